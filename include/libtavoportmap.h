@@ -1,0 +1,520 @@
+/*
+ * libtavoportmap: finds out what the home router in front of the box is, keeps its settings and writes
+ * the box's port-forwarding rules into it.
+ *
+ * The flat functions take plain records and can be called from C11 and C++; classes and what needs
+ * references stand under __cplusplus. Every function runs on the caller's thread. Nothing is thrown:
+ * flat functions answer 0 for success and -1 for failure unless their comment says otherwise, class
+ * members 1 (true) and 0 (false); the reason of a failure is one line in the system log (priority
+ * error). Records passed in belong to the caller and are only read or filled. Arrays and lists handed
+ * out are malloc blocks of the caller's, released with the function named beside them. Texts are
+ * NUL-terminated; a text that does not fit a field is cut.
+ */
+#ifndef LIBTAVOPORTMAP_H
+#define LIBTAVOPORTMAP_H
+
+#include <stdbool.h>
+#include <stddef.h>
+
+#ifdef __cplusplus
+#include <json/value.h>
+
+#include <string>
+#endif
+
+#if defined(__GNUC__)
+#define TAVO_API __attribute__((visibility("default")))
+#else
+#define TAVO_API
+#endif
+
+#ifdef __cplusplus
+#define TAVO_LAYOUT static_assert
+extern "C" {
+#else
+#define TAVO_LAYOUT _Static_assert
+#endif
+
+/* ---- enums; the values are fixed, a record stores them in four bytes ---------------------------- */
+
+/* Whether the router supports a protocol; as text "no", "yes", "unknown". */
+typedef enum __tag_TAVO_ROUTER_SUPPORT {
+    TAVO_ROUTER_SUPPORT_NO = 0,
+    TAVO_ROUTER_SUPPORT_YES = 1,
+    TAVO_ROUTER_SUPPORT_UNKNOWN = 2
+} __tag_TAVO_ROUTER_SUPPORT;
+
+/* What the library is busy with. */
+typedef enum __tag_TAVO_LIBTAVOPORTMAP_TASK {
+    TAVO_LIBTAVOPORTMAP_TASK_IDLE = 0,
+    TAVO_LIBTAVOPORTMAP_TASK_TESTING = 1, /* a UPnP compatibility test */
+    TAVO_LIBTAVOPORTMAP_TASK_SAVING = 2   /* rules are being saved to the router */
+} __tag_TAVO_LIBTAVOPORTMAP_TASK;
+
+/* Why a getter or setter failed; look at the return value first. */
+typedef enum __tag_TAVO_LIBTAVOPORTMAP_ERR {
+    TAVO_LIBTAVOPORTMAP_ERR_NONE = 0,
+    TAVO_LIBTAVOPORTMAP_ERR_FAILED = 1,
+    TAVO_LIBTAVOPORTMAP_ERR_CONFLICT = 2,      /* another operation holds the router lock */
+    TAVO_LIBTAVOPORTMAP_ERR_NO_WAN = 3,        /* detection only */
+    TAVO_LIBTAVOPORTMAP_ERR_DNS = 4,           /* detection only */
+    TAVO_LIBTAVOPORTMAP_ERR_SYNTAX_VERSION = 6 /* the router database is newer than the forward tool */
+} __tag_TAVO_LIBTAVOPORTMAP_ERR;
+
+/* What is known of the gateway; as text "unknown", "not_initialized", "upnp_natpmp", "manual". */
+typedef enum __TAG_TAVO_ROUTER_INIT_STATE {
+    TAVO_ROUTER_INIT_STATE_UNKNOWN = 0,
+    TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED = 1,
+    TAVO_ROUTER_INIT_STATE_UPNP_NATPMP = 2,
+    TAVO_ROUTER_INIT_STATE_MANUAL = 3
+} __TAG_TAVO_ROUTER_INIT_STATE;
+
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SUPPORT) == 4, "four bytes");
+TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_TASK) == 4, "four bytes");
+TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_ERR) == 4, "four bytes");
+TAVO_LAYOUT(sizeof(__TAG_TAVO_ROUTER_INIT_STATE) == 4, "four bytes");
+
+/* ---- records ------------------------------------------------------------------------------------ */
+
+enum { TAVO_TEXT_SIZE = 1024 }; /* bytes of every text field, the NUL included */
+
+/* One port-forwarding rule. Ports: one port, a list or ranges, as stored. */
+typedef struct __tag_TAVO_ROUTER_RULE {
+    char szRuleID[TAVO_TEXT_SIZE]; /* section name in rule.conf */
+    bool blEnable;
+    char szProtocol[TAVO_TEXT_SIZE];
+    char szRouterPort[TAVO_TEXT_SIZE];
+    char szSrcPort[TAVO_TEXT_SIZE];
+    char szServiceID[TAVO_TEXT_SIZE]; /* empty when absent */
+    char szServiceName[TAVO_TEXT_SIZE];
+    int enTestStatus; /* 0 not tested, 1 disabled, 2 ok, 3 fail; 0 in arrays read from files */
+} __tag_TAVO_ROUTER_RULE;
+TAVO_LAYOUT(sizeof(bool) == 1, "one byte");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_RULE, szProtocol) == 1025, "rule layout");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_RULE, enTestStatus) == 6148, "rule layout");
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_RULE) == 6152, "rule layout");
+
+/* The settings of the router behind one gateway address. */
+typedef struct __tag_TAVO_ROUTER_CONF {
+    char szBrand[TAVO_TEXT_SIZE];
+    char szModel[TAVO_TEXT_SIZE];
+    char szVersion[TAVO_TEXT_SIZE];
+    char szSupportUpnp[TAVO_TEXT_SIZE];   /* "yes", "no" or "unknown" */
+    char szSupportNatpmp[TAVO_TEXT_SIZE]; /* "yes", "no" or "unknown" */
+    char szUser[TAVO_TEXT_SIZE];
+    char szPass[TAVO_TEXT_SIZE];
+    char szConnType[TAVO_TEXT_SIZE];
+    char szConnPort[TAVO_TEXT_SIZE];
+    char szMaxRule[TAVO_TEXT_SIZE]; /* decimal; only ever read */
+} __tag_TAVO_ROUTER_CONF;
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_CONF) == 10 * 1024, "settings layout");
+
+/* Outcome and progress of router detection. */
+typedef struct __tag_TAVO_ROUTER_DETECT_RESULT {
+    int nProgress;      /* percent */
+    int errCode;        /* __tag_TAVO_LIBTAVOPORTMAP_ERR */
+    int nEnvFlags;      /* 1: gateway setting wrong; 2: public IP level unknown; 4: more than one NAT */
+    int nPublicIPLevel; /* -1 when it could not be read */
+    char szGateway[TAVO_TEXT_SIZE];
+    char szInterface[TAVO_TEXT_SIZE];
+    int enSupportUpnp;   /* __tag_TAVO_ROUTER_SUPPORT */
+    int enSupportNatpmp; /* __tag_TAVO_ROUTER_SUPPORT */
+    char szBrand[TAVO_TEXT_SIZE];
+    char szModel[TAVO_TEXT_SIZE];
+    char szVersion[TAVO_TEXT_SIZE];
+    char szUpnpPfPath[TAVO_TEXT_SIZE];
+    char szUserSettingName[TAVO_TEXT_SIZE];
+    int nMaxRule; /* -1 when unknown */
+} __tag_TAVO_ROUTER_DETECT_RESULT;
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_DETECT_RESULT, enSupportUpnp) == 16 + 2 * 1024, "detect layout");
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_DETECT_RESULT) == 28 + 7 * 1024, "detect layout");
+
+/* What a router model's own pages can do. */
+typedef struct __tag_TAVO_ROUTER_DESC {
+    bool blSupportChangePort; /* the router port of a rule may differ from the box port */
+} __tag_TAVO_ROUTER_DESC;
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_DESC) == 1, "description layout");
+
+/* The known router models, a singly linked list released with TLibFreeRouterDBList. */
+typedef struct __tag_TAVO_ROUTERDB_LIST {
+    char szBrand[TAVO_TEXT_SIZE];
+    char szModel[TAVO_TEXT_SIZE];
+    char szVersion[TAVO_TEXT_SIZE];
+    int blGeneric; /* 1: the description is not tied to a firmware version */
+    struct __tag_TAVO_ROUTERDB_LIST* pNext;
+} __tag_TAVO_ROUTERDB_LIST;
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, blGeneric) == 3 * 1024, "list layout");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, pNext) % sizeof(void*) == 0, "list layout");
+
+/* Progress and outcome of saving rules. Set nStatus to 0 before the call: the save never resets it. */
+typedef struct __tag_TAVO_ROUTER_SAVE_RULE_RESULT {
+    int nProgress; /* percent: 20, 40, 60, 80, 90, 100 */
+    int nStatus;   /* 2 locked, 7 too many rules, 8 port conflict, 9 add failed, 10 to 12 manual router's limits */
+    union {
+        char szPortList[TAVO_TEXT_SIZE]; /* 8 and 9: the refused mappings */
+        __extension__ struct {
+            int nLimit;  /* 7, 10, 11, 12: the limit; -1 unknown cause */
+            int nLimit2; /* 12: the range limit */
+        };
+    };
+} __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, szPortList) == 8, "save layout");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, nLimit) == 8, "save layout");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, nLimit2) == 12, "save layout");
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT) == 8 + 1024, "save layout");
+
+/* Progress and outcome of the UPnP compatibility test. */
+typedef struct __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT {
+    int nProgress;
+    int nStatus;
+    char szBrand[TAVO_TEXT_SIZE];
+    char szModel[TAVO_TEXT_SIZE];
+    char szVersion[TAVO_TEXT_SIZE];
+    char szSupport[TAVO_TEXT_SIZE]; /* "yes" or "no" */
+    int nMaxRule;                   /* -1 when the test failed */
+} __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT) == 12 + 4 * 1024, "test layout");
+
+/* One test record for the UPnP compatibility database. */
+typedef struct __tag_TAVO_ROUTER_RECORD {
+    char szBrand[TAVO_TEXT_SIZE];
+    char szModel[TAVO_TEXT_SIZE];
+    char szVersion[TAVO_TEXT_SIZE];
+    char szSupport[TAVO_TEXT_SIZE];
+    int nMaxRule; /* -1 unknown */
+} __tag_TAVO_ROUTER_RECORD;
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_RECORD) == 4 + 4 * 1024, "record layout");
+
+/* One port request of the relay service. */
+typedef struct __tag_TAVO_PORTMAP_RULE {
+    int nTestConnStatus; /* 0 not tested, 1 disabled, 2 ok, 3 fail */
+    char szPorts[TAVO_TEXT_SIZE];
+    int enProtocol; /* 0 tcp, 1 udp, 2 all */
+} __tag_TAVO_PORTMAP_RULE;
+TAVO_LAYOUT(sizeof(__tag_TAVO_PORTMAP_RULE) == 8 + 1024, "request layout");
+
+/* A parsed section of a configuration file, of the platform's port-forward library. */
+struct _tag_tavo_pf_conf;
+
+/* ---- support words, rule arrays ----------------------------------------------------------------- */
+
+/* Writes "no", "yes" or "unknown", cut at nOutSize - 1. -1: null szOut. An unlisted value is logged,
+ * leaves szOut as it was and still gives 0. */
+TAVO_API int TLibSupportEnumToString(char* szOut, int nOutSize, __tag_TAVO_ROUTER_SUPPORT enSupport);
+/* The reverse, case-sensitive. -1: a null argument or another text; the output is untouched. */
+TAVO_API int TLibSupportStringToEnum(__tag_TAVO_ROUTER_SUPPORT* pEnSupport, const char* szSupport);
+/* Releases an array of TLibGetRulesArrFrom*; NULL is fine. Always 0. */
+TAVO_API int TLibFreeRulesArr(__tag_TAVO_ROUTER_RULE* pRules);
+
+/* ---- locks and busy state ----------------------------------------------------------------------- */
+
+/* Takes the router lock for this process, without waiting. 0: taken; -1: held elsewhere. While it is
+ * held, call the other functions with blLock false. */
+TAVO_API int TLibTavoPortMapLock(void);
+/* Gives it back; one unlock for one lock. Always 0. */
+TAVO_API int TLibTavoPortMapUnLock(void);
+/* What is running now, in any process. -1: null pointer. */
+TAVO_API int TLibGetLibTavoPortMapRunningTask(__tag_TAVO_LIBTAVOPORTMAP_TASK* pEnTask);
+/* 1: rules are being written to the router; 0: not. */
+TAVO_API int IsSavingRules(void);
+TAVO_API void unlock_file(int fd);
+
+/* ---- gateway address ---------------------------------------------------------------------------- */
+
+/* The default gateway's IPv4 address as text, cut at nSize - 1. */
+TAVO_API int TLibGetGatewayIP(char* szOutGatewayIP, int nSize);
+
+/* ---- rule files --------------------------------------------------------------------------------- */
+
+/* The rules of rule.conf (testrule.conf) as one array: *ppRules must be NULL on entry and is released
+ * with TLibFreeRulesArr. szIdList: only these rules, NULL for all. An absent or empty file gives 0 rules
+ * and NULL. pErr may be NULL; it is 2 when blLock asked for the router lock and it was held. */
+TAVO_API int TLibGetRulesArrFromRuleConf(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, char* szIdList, bool blLock,
+                                         __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr);
+TAVO_API int TLibGetRulesArrFromTestRuleConf(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, char* szIdList,
+                                             bool blLock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr);
+/* Both of the above: rule.conf when blRuleConf, else testrule.conf. */
+TAVO_API int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool blRuleConf, char* szIdList,
+                                     bool blLock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr);
+
+/* ---- router description database ------------------------------------------------------------------ */
+
+/* These three answer -1 for a null argument, else 1 for success and 0 for failure. */
+TAVO_API int TLibGetRouterDBList(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList);
+TAVO_API int TLibFreeRouterDBList(__tag_TAVO_ROUTERDB_LIST* plRouterDBList);
+TAVO_API int TLibUpdateRouterDBList(int* pnVersion);
+/* What the manual router behind szGwRouterIP can do. pErr may be NULL; it is 1 on every path (success
+ * too), 2 when the lock was held. */
+TAVO_API int TLibGetRouterDesc(const char* szGwRouterIP, __tag_TAVO_ROUTER_DESC* routerDesc,
+                               __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
+/* Rule syntax version of the installed port-forward tool; -1 when it tells none. */
+TAVO_API int IGetCurrSyntaxVersion(void);
+
+/* ---- saving rules ------------------------------------------------------------------------------- */
+
+/* Makes rgRules the rule set of the box and writes it to the router; waits up to about five minutes.
+ * saveResult may be NULL only without pfnCallback and without blLock. The callback is called on this
+ * thread after each change of nProgress, never with a failure. */
+TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUTER_RULE* rgRules, bool blLock,
+                           __tag_TAVO_ROUTER_SAVE_RULE_RESULT* saveResult,
+                           void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData);
+
+#ifdef __cplusplus
+} /* extern "C" */
+
+/* Opens (creating it) and locks szPath without waiting; fd receives the descriptor also when the lock
+ * is held elsewhere: pass it to unlock_file in every case. 1: locked; 0: not. */
+TAVO_API int lock_file(const char* szPath, int& fd);
+/* The default gateway's IPv4 address. 1: set; 0: there is none. */
+TAVO_API int GetGatewayIP(std::string& ip);
+
+/* "brand: model(version)" or "brand: model" into its three parts. */
+TAVO_API bool SplitRouterName(char* szName, std::string& brand, std::string& model, std::string& version);
+/* Whether a router name carries no version. */
+TAVO_API bool IsGenericRouterName(bool& isGeneric, char* szName);
+
+/* Accessors of one parsed rule section. Every one answers 0 for a null or empty node. */
+namespace PF_CONF {
+TAVO_API int IsRuleEnable(bool& blEnable, const _tag_tavo_pf_conf* pConf);
+TAVO_API int GetRuleID(std::string& id, const _tag_tavo_pf_conf* pConf);
+TAVO_API int GetRuleProtocol(std::string& protocol, const _tag_tavo_pf_conf* pConf);
+/* Empty when the rule has none. */
+TAVO_API int GetRuleServiceID(std::string& serviceID, const _tag_tavo_pf_conf* pConf);
+/* Unchanged when the rule has none. */
+TAVO_API int GetRuleServiceName(std::string& serviceName, const _tag_tavo_pf_conf* pConf);
+/* Both outputs or none. */
+TAVO_API int GetRulePort(std::string& routerPort, std::string& srcPort, const _tag_tavo_pf_conf* pConf);
+/* extra is never written. */
+TAVO_API int GetRuleInfo(std::string& id, bool& blEnable, std::string& routerPort, std::string& srcPort,
+                         std::string& protocol, std::string& serviceID, std::string& extra,
+                         const _tag_tavo_pf_conf* pConf);
+/* The list as one array, released with FreeArray; *ppRules must be NULL on entry. A rule without a
+ * service name gets the one of the rule before it. */
+TAVO_API int ToArray(int& nCount, __tag_TAVO_ROUTER_RULE** ppRules, const _tag_tavo_pf_conf* pHead);
+/* Always 0. */
+TAVO_API int FreeArray(__tag_TAVO_ROUTER_RULE* pRules);
+}  // namespace PF_CONF
+
+/* One snapshot of router.conf and the section of one gateway in it. */
+class TAVO_API RouterConfReader {
+public:
+    /* The section named gatewayIP. */
+    explicit RouterConfReader(const std::string& gatewayIP);
+    /* The first section. */
+    RouterConfReader();
+    ~RouterConfReader();
+    RouterConfReader(const RouterConfReader&) = delete;
+    RouterConfReader& operator=(const RouterConfReader&) = delete;
+
+    /* 0 when the file could not be loaded. */
+    int IsSectionExist(bool& blExist);
+    int GetSectionName(std::string& name);
+    /* 0 without a section; a missing key is success and leaves the output unchanged. */
+    int GetBrand(std::string& brand);
+    int GetModel(std::string& model);
+    int GetVersion(std::string& version);
+    int GetUser(std::string& user);
+    int GetPass(std::string& pass);
+    int GetConnType(std::string& connType);
+    int GetConnPort(std::string& connPort);
+    int GetSupportUpnp(std::string& support);
+    int GetSupportNatpmp(std::string& support);
+    /* True exactly for "yes". */
+    int GetSupportUpnp(bool& blSupport);
+    int GetSupportNatpmp(bool& blSupport);
+    /* 0 also without a "max" key. */
+    int GetMaxRule(int& nMaxRule);
+
+private:
+    _tag_tavo_pf_conf* mPHead;
+    _tag_tavo_pf_conf* mPCurrent;
+};
+
+/* Builds the section of the current gateway and replaces router.conf with it. */
+class TAVO_API RouterConfWriter {
+public:
+    /* blReload: keep the gateway's old section and those of other gateways; else only the new section
+     * is written. Nothing is loaded before the first setter. */
+    explicit RouterConfWriter(bool blReload);
+    ~RouterConfWriter();
+    RouterConfWriter(const RouterConfWriter&) = delete;
+    RouterConfWriter& operator=(const RouterConfWriter&) = delete;
+
+    int Init();
+    int IsValid();
+    int ReloadOldSection(const std::string& gatewayIP);
+    int CreateNewSection(const std::string& gatewayIP);
+    int SetBrand(const std::string& brand);
+    int SetModel(const std::string& model);
+    int SetVersion(const std::string& version);
+    int SetBrandModelVersion(const std::string& brand, const std::string& model, const std::string& version);
+    int SetUser(const std::string& user);
+    int SetPass(const std::string& pass);
+    int SetUserPass(const std::string& user, const std::string& pass);
+    int SetConnType(const std::string& connType);
+    int SetConnPort(const std::string& connPort);
+    int SetMaxRule(int nMaxRule);
+    /* Also claims the router type. */
+    int SetSupportUpnp(const std::string& support);
+    int SetSupportNatpmp(const std::string& support);
+    /* Replaces router.conf; a failure leaves the old one. */
+    int Sync();
+
+private:
+    bool mBlReload;
+    bool mBlInit;
+    _tag_tavo_pf_conf* mPHead;
+    _tag_tavo_pf_conf* mPCurrent;
+};
+
+/* Walks one snapshot of a rule file: StartNextRule(), then NextRule() while it answers 1. */
+class TAVO_API RouterRuleConfReader {
+public:
+    /* true: testrule.conf; false: rule.conf. */
+    explicit RouterRuleConfReader(bool blTestRule);
+    ~RouterRuleConfReader();
+    RouterRuleConfReader(const RouterRuleConfReader&) = delete;
+    RouterRuleConfReader& operator=(const RouterRuleConfReader&) = delete;
+
+    int StartNextRule();
+    int NextRule();
+    int GetRulesNumber(int& nRules);
+    int IsRuleEnable(bool& blEnable);
+    int GetRuleID(std::string& id);
+    int GetRuleProtocol(std::string& protocol);
+    int GetRulePort(std::string& routerPort, std::string& srcPort);
+    int GetRuleServiceID(std::string& serviceID);
+    int GetRuleServiceName(std::string& serviceName);
+    int GetRuleInfo(bool& blEnable, std::string& routerPort, std::string& srcPort, std::string& protocol,
+                    std::string& serviceID);
+
+private:
+    _tag_tavo_pf_conf* mPHead;
+    _tag_tavo_pf_conf* mPCurrent;
+    bool mBlTestRule;
+};
+
+/* Builds a whole rule file. */
+class TAVO_API RouterRuleConfWriter {
+public:
+    RouterRuleConfWriter();
+    ~RouterRuleConfWriter();
+    RouterRuleConfWriter(const RouterRuleConfWriter&) = delete;
+    RouterRuleConfWriter& operator=(const RouterRuleConfWriter&) = delete;
+
+    int AddRule(const std::string& id, bool blEnable, const std::string& routerPort, const std::string& srcPort,
+                const std::string& protocol, const std::string& serviceID, const std::string& serviceName);
+    int AddRule(int nId, bool blEnable, const std::string& routerPort, const std::string& srcPort,
+                const std::string& protocol, const std::string& serviceID, const std::string& serviceName);
+    /* Replaces rule.conf; a failure puts the old one back. */
+    int Sync();
+    int Sync(const std::string& path);
+    int GetRules(int& nRules);
+    /* Jobs for single ports and for ranges that the rules need on the router at gatewayIP. */
+    int GetPorts(int& nPorts, const std::string& gatewayIP);
+    int GetRange(int& nRange, const std::string& gatewayIP);
+    /* The list stays the writer's. */
+    int GetRuleConf(_tag_tavo_pf_conf** pRuleConfHead);
+    int ToArray(int& nCount, __tag_TAVO_ROUTER_RULE** ppRules);
+
+private:
+    _tag_tavo_pf_conf* mPHead;
+    _tag_tavo_pf_conf* mPTail;
+};
+
+/* What the description database says of the manual router behind a gateway address. */
+class TAVO_API RouterDB {
+public:
+    explicit RouterDB(const std::string& gwRouterIP);
+    ~RouterDB();
+    RouterDB(const RouterDB&) = delete;
+    RouterDB& operator=(const RouterDB&) = delete;
+
+    /* Builds the flat description; the accessors call it when needed. */
+    bool GetRouterDesc();
+    bool GetSyntaxVersion(int& nVersion);
+    bool GetMaxPorts(int& nMaxPorts);
+    bool GetMaxRange(int& nMaxRange);
+    bool IsSupportChangePort(bool& blSupport);
+    bool IsSupportPageRange(bool& blSupport);
+    static bool List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList);
+    static bool FreeList(__tag_TAVO_ROUTERDB_LIST* plRouterDBList);
+    static bool Update(int& nVersion);
+
+private:
+    std::string mSzGwRouterIP;
+    int mBlLoaded;
+    Json::Value mJsDesc;
+};
+
+/* What the UPnP compatibility databases, downloaded and the user's own, say of one router model. */
+class TAVO_API RouterUpnpDB {
+public:
+    RouterUpnpDB(const std::string& brand, const std::string& model, const std::string& version);
+    ~RouterUpnpDB();
+
+    /* False for an empty brand, model and version; fetches a missing database once. */
+    bool IsValid();
+    /* "yes", "no" or "unknown". */
+    bool GetSupport(std::string& support);
+    /* Rules that the router holds; false with -1 when unknown. */
+    bool GetMaxRule(int& nMaxRule);
+    /* Name of the matching router description. */
+    bool GetPfpath(std::string& pfpath);
+    static bool Update(int& nVersion);
+
+private:
+    std::string mSzKey;
+};
+
+/* Writes the user's own test result; the file holds only the last one. */
+class TAVO_API RouterUpnpDBUserWriter {
+public:
+    /* section: brand/model/version. */
+    explicit RouterUpnpDBUserWriter(const std::string& section);
+    ~RouterUpnpDBUserWriter();
+    RouterUpnpDBUserWriter(const RouterUpnpDBUserWriter&) = delete;
+    RouterUpnpDBUserWriter& operator=(const RouterUpnpDBUserWriter&) = delete;
+
+    bool Init();
+    bool SetSupport(const std::string& support);
+    bool SetMaxRule(int nMaxRule);
+    bool Sync();
+
+private:
+    std::string mSzSection;
+    _tag_tavo_pf_conf* mPSection;
+};
+
+/* Control of the UPnP port-mapping daemon. */
+class TAVO_API UpnpDaemon {
+public:
+    /* False also while the daemon runs in test mode. */
+    bool IsAlive();
+    /* Starts the daemon, or has a running one read its rules again; the other daemon is told to stop mapping. */
+    bool Start();
+    /* What the router refused, appended to the texts with ", " between the items: because the port is
+     * taken (conflict), or for another reason (error). Waits up to about 22 seconds. */
+    bool CheckDaemon(bool& blConflict, bool& blError, std::string& strConflict, std::string& strError);
+};
+
+/* Control of the NAT-PMP port-mapping daemon. */
+class TAVO_API NatpmpDaemon {
+public:
+    bool IsAlive();
+    bool Start();
+    /* The mappings that had to be given another port. Waits up to about 21 seconds. */
+    bool CheckDaemon(bool& blRemap, std::string& strRemap);
+};
+
+/* The script that applies the rules on a manual router. */
+class TAVO_API PortForwardScript {
+public:
+    /* Runs it and waits for it; a script that ran and failed is true. */
+    bool Run();
+    bool IsAlive();
+};
+#endif /* __cplusplus */
+
+#undef TAVO_LAYOUT
+#endif /* LIBTAVOPORTMAP_H */

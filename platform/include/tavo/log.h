@@ -1,0 +1,25 @@
+/* The event log, for what the user must see, and the router log. */
+#ifndef TAVO_LOG_H
+#define TAVO_LOG_H
+
+#pragma GCC visibility push(default)
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+enum { /* events of TAVOLogSet1 */
+       TAVO_EVENT_PF_ADD_FAILED = 0x13100020,
+       TAVO_EVENT_PF_CONFLICT = 0x13100022
+};
+
+/* Appends one event to /var/log/tavo/event.log: time, level (1 information, 2 warning, 3 error), event
+ * number and the message of the catalogue with the texts in it; control characters are made harmless.
+ * nKind 1: system events, the only kind. 0: written; -1: failed. */
+int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
+                const char* szText4);
+
+#ifdef __cplusplus
+}
+#endif
+#pragma GCC visibility pop
+#endif

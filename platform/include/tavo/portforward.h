@@ -1,0 +1,79 @@
+/*
+ * The port-forward library of the platform: rule and router files as lists of parsed sections, rule
+ * and job counts, and the router description database.
+ *
+ * A list belongs to whoever received it and is released whole with TAVOPFConfFree. Files are written
+ * as core.h says: atomically, created 0600, a failed write leaves the old file.
+ */
+#ifndef TAVO_PORTFORWARD_H
+#define TAVO_PORTFORWARD_H
+
+#include "tavo/core.h"
+
+#pragma GCC visibility push(default)
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+enum { TAVO_PF_NAME_SIZE = 1024 };
+
+/* One parsed section. Nodes and hashes are made with calloc and TLIBCSzHashAlloc. */
+typedef struct _tag_tavo_pf_conf {
+    char szSection[TAVO_PF_NAME_SIZE]; /* section name */
+    TLIBCSzHash* pHash;                /* its pairs; NULL: an empty section */
+    struct _tag_tavo_pf_conf* pNext;   /* next section in file order; NULL: the last */
+} TAVO_PF_CONF;
+
+/* The script operations of a router model; opaque to callers. */
+typedef struct tag_TAVO_ROUTER_SCRIPT TAVO_ROUTER_SCRIPT;
+
+/* Releases every node with its hash. NULL is ignored. */
+void TAVOPFConfFree(TAVO_PF_CONF* pHead);
+
+/* All sections of /etc/portforward/rule.conf (testrule.conf), in file order. NULL: no file, an empty
+ * one, or one that cannot be parsed (the last error tells them apart: TLIBC_ERR_NONE for empty). */
+TAVO_PF_CONF* TAVOPFRuleGet(void);
+TAVO_PF_CONF* TAVOPFTestRuleGet(void);
+/* The sections whose names stand in szIdList (separated by "," or blanks), in file order; NULL or an
+ * empty list: all of them. NULL: as above, or nothing matches. */
+TAVO_PF_CONF* TAVOPFRuleGetByIdList(const char* szIdList);
+TAVO_PF_CONF* TAVOPFTestRuleGetByIdList(const char* szIdList);
+/* Writes the list as the whole file; a null list makes an empty file. 0: written; negative: failed. */
+int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath);
+/* The same for /etc/portforward/router.conf. */
+TAVO_PF_CONF* TAVOPFGwRouterConfGet(void);
+int TAVOGwRouterConfSet(const TAVO_PF_CONF* pHead);
+
+/* Number of rules in the list; nEnabledOnly non-zero: only those with "enabled" = "1". 0 for a null
+ * list; negative: more rules than an int counts. */
+int TLIBPFCountRuleConf(const TAVO_PF_CONF* pHead, int nEnabledOnly);
+/* Number of jobs of kind szJob ("PF add port": one per single router port, "PF add range": one per
+ * router port range) that the enabled rules need on the router in front (szGwRouterIP): a rule for
+ * both protocols is one job where every page takes both at once, else two. 0 for a null list;
+ * negative: null or unknown job name, null address, or a rule whose ports cannot be read. */
+int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, const char* szJob);
+/* 1: 1 to 65535; 0: anything else. */
+int TAVOPFIsValidPortNo(int nPort);
+
+/* ---- router description database, /etc.defaults/portforward/routerdb --------------------------- */
+
+/* Names of all known models: "brand: model(version)", or "brand: model" for a model with a "generic"
+ * file; sorted. Number of names with *ppList set (caller frees); negative: no database or bad input. */
+int RouterDBList(TLIBCSzList** ppList);
+/* The description sections and the script operations of the router that pSection (one section of
+ * router.conf: "brand", "model", "version") names. A version without a directory of its own falls
+ * back to the model's "generic" version. 0: both outputs set (caller frees both); negative: unknown
+ * model, unreadable file, or a name that is no plain file name; outputs untouched. */
+int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF** ppDesc, TAVO_ROUTER_SCRIPT** ppOps);
+void TAVORouterScriptFree(TAVO_ROUTER_SCRIPT* pOps);
+/* Fetches the database anew from GetRouterDBPath() and puts it in place only when it is whole.
+ * Its version (the "version" key of the database's "version" file); negative: failed, the old one stays. */
+int TAVOPFRouterDBUpdate(void);
+/* Where the databases are downloaded from (server and directory); static storage. */
+const char* GetRouterDBPath(void);
+
+#ifdef __cplusplus
+}
+#endif
+#pragma GCC visibility pop
+#endif

@@ -1,0 +1,299 @@
+// Finds, signals and starts processes. Relies on /proc, posix_spawn and close_range.
+// Promises: children get no descriptor above standard error and default signals; TLIBCExec leaves no
+// zombie; zombies do not count as alive.
+#include <dirent.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "core/Border.h"
+#include "core/Descriptor.h"
+#include "core/TextFile.h"
+#include "tavo/core.h"
+
+extern char** environ;
+
+namespace {
+
+constexpr char kFile[] = "platform/linux/core/Proc.cpp";
+constexpr size_t kKernelNameSize = 15;
+constexpr int kSignalledStatus = 128;
+
+using tavo::AtBorder;
+using tavo::Descriptor;
+
+int Fail(int nErr, int nLine) {
+    TLIBCErrSet(nErr, kFile, nLine);
+    return -1;
+}
+
+struct DirCloser {
+    void operator()(DIR* pDir) const { closedir(pDir); }
+};
+
+// /proc files tell no size: read to the end.
+std::string ReadProc(const std::string& szPath) {
+    std::string szText;
+    const Descriptor fd(open(szPath.c_str(), O_RDONLY | O_CLOEXEC));
+    char szBlock[4096];
+    ssize_t nRead = 0;
+    while (fd.Get() >= 0 && (nRead = read(fd.Get(), szBlock, sizeof(szBlock))) > 0) {
+        szText.append(szBlock, static_cast<size_t>(nRead));
+    }
+    return szText;
+}
+
+std::string BaseName(const std::string& szPath) {
+    return szPath.substr(szPath.rfind('/') + 1);
+}
+
+bool IsInterpreter(const std::string& szName) {
+    static constexpr const char* kNames[] = {"sh", "bash", "dash", "perl", "python3", "python", "env"};
+    return std::any_of(std::begin(kNames), std::end(kNames), [&](const char* szKnown) { return szName == szKnown; }) ||
+           szName.starts_with("python3.");
+}
+
+std::vector<std::string> Arguments(const std::string& szCommandLine) {
+    std::vector<std::string> rgArguments;
+    for (size_t i = 0; i < szCommandLine.size();) {
+        size_t nEnd = szCommandLine.find('\0', i);
+        nEnd = nEnd == std::string::npos ? szCommandLine.size() : nEnd;
+        rgArguments.push_back(szCommandLine.substr(i, nEnd - i));
+        i = nEnd + 1;
+    }
+    return rgArguments;
+}
+
+bool IsZombie(const std::string& szDir) {
+    const std::string szStat = ReadProc(szDir + "/stat");
+    const size_t nState = szStat.rfind(')');
+    return nState == std::string::npos || nState + 2 >= szStat.size() || szStat[nState + 2] == 'Z' ||
+           szStat[nState + 2] == 'X';
+}
+
+// The script that an interpreter runs, by its base name; empty when it runs none.
+std::string ScriptName(const std::vector<std::string>& rgArguments) {
+    if (!IsInterpreter(BaseName(rgArguments.front()))) {
+        return "";
+    }
+    for (size_t i = 1; i < rgArguments.size(); ++i) {
+        if (rgArguments[i] == "-c" || rgArguments[i] == "-m") {
+            return "";
+        }
+        if (!rgArguments[i].starts_with("-")) {
+            return BaseName(rgArguments[i]);
+        }
+    }
+    return "";
+}
+
+bool Matches(const std::string& szDir, const std::string& szName) {
+    const std::vector<std::string> rgArguments = Arguments(ReadProc(szDir + "/cmdline"));
+    if (rgArguments.empty() || IsZombie(szDir)) {  // kernel threads have no command line
+        return false;
+    }
+    if (szName.find_first_of("/ ") != std::string::npos) {
+        std::string szWhole = rgArguments.front();
+        for (size_t i = 1; i < rgArguments.size(); ++i) {
+            szWhole += " " + rgArguments[i];
+        }
+        return szWhole == szName;
+    }
+    if (BaseName(rgArguments.front()) == szName || ScriptName(rgArguments) == szName) {
+        return true;
+    }
+    const std::string szKernelName = ReadProc(szDir + "/comm");
+    return szKernelName.substr(0, szKernelName.find('\n')) == szName.substr(0, kKernelNameSize) &&
+           szName.size() <= kKernelNameSize;
+}
+
+// Calls fnFound with the pid of every process of that name; false when /proc cannot be read.
+bool ForEachProcess(const std::string& szName, const std::function<void(pid_t)>& fnFound) {
+    const std::unique_ptr<DIR, DirCloser> pDir(opendir("/proc"));
+    if (!pDir) {
+        return false;
+    }
+    while (const dirent* pEntry = readdir(pDir.get())) {
+        const pid_t pid = static_cast<pid_t>(std::strtol(pEntry->d_name, nullptr, 10));
+        if (pid > 0 && Matches("/proc/" + std::string(pEntry->d_name), szName)) {
+            fnFound(pid);
+        }
+    }
+    return true;
+}
+
+void ResetSignals() {
+    for (int nSignal = 1; nSignal < NSIG; ++nSignal) {
+        signal(nSignal, SIG_DFL);
+    }
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+}
+
+// In the grandchild: becomes the program, or writes errno to the pipe.
+[[noreturn]] void BecomeProgram(char* const* rgszArguments, int fdReport) {
+    ResetSignals();
+    const int fdNull = open("/dev/null", O_RDWR);
+    for (int fd = STDIN_FILENO; fdNull >= 0 && fd <= STDERR_FILENO; ++fd) {
+        dup2(fdNull, fd);
+    }
+    // The report pipe moves to a fixed place, so that all above it can be closed in one call.
+    constexpr int kReport = STDERR_FILENO + 1;
+    if (fdReport != kReport) {
+        dup2(fdReport, kReport);
+    }
+    fcntl(kReport, F_SETFD, FD_CLOEXEC);
+    close_range(kReport + 1, ~0U, 0);
+    execv(rgszArguments[0], rgszArguments);
+    const int nErrno = errno;
+    const ssize_t nWritten = write(kReport, &nErrno, sizeof(nErrno));
+    _exit(nWritten == sizeof(nErrno) ? 127 : 126);
+}
+
+int WaitFor(pid_t pid) {
+    int nStatus = 0;
+    while (waitpid(pid, &nStatus, 0) < 0) {
+        if (errno != EINTR) {
+            return -1;
+        }
+    }
+    return WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : kSignalledStatus + WTERMSIG(nStatus);
+}
+
+class SpawnSetup {
+public:
+    SpawnSetup() {
+        posix_spawn_file_actions_init(&mActions);
+        posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
+        posix_spawnattr_init(&mAttributes);
+        sigset_t all;
+        sigset_t none;
+        sigfillset(&all);
+        sigemptyset(&none);
+        posix_spawnattr_setsigdefault(&mAttributes, &all);
+        posix_spawnattr_setsigmask(&mAttributes, &none);
+        posix_spawnattr_setflags(&mAttributes, POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK);
+    }
+    ~SpawnSetup() {
+        posix_spawn_file_actions_destroy(&mActions);
+        posix_spawnattr_destroy(&mAttributes);
+    }
+    SpawnSetup(const SpawnSetup&) = delete;
+    SpawnSetup& operator=(const SpawnSetup&) = delete;
+
+    // The child's pid, or -1.
+    pid_t Spawn(const char* szPath, char* const* rgszArguments) const {
+        pid_t pid = -1;
+        const int nErrno = posix_spawn(&pid, szPath, &mActions, &mAttributes, rgszArguments, environ);
+        return nErrno == 0 ? pid : -1;
+    }
+
+private:
+    posix_spawn_file_actions_t mActions;
+    posix_spawnattr_t mAttributes;
+};
+
+}  // namespace
+
+int TLIBCIsProcAlive(const char* szName) {
+    return AtBorder(-1, [&] {
+        if (szName == nullptr || *szName == '\0') {
+            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        }
+        bool blAlive = false;
+        if (!ForEachProcess(szName, [&blAlive](pid_t) { blAlive = true; })) {
+            return Fail(TLIBC_ERR_READ, __LINE__);
+        }
+        return blAlive ? 1 : 0;
+    });
+}
+
+int TLIBCKill(const char* szName, int nSignal) {
+    return AtBorder(-1, [&] {
+        if (szName == nullptr || *szName == '\0' || nSignal < 0 || nSignal >= NSIG) {
+            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        }
+        int nSignalled = 0;
+        const bool blRead = ForEachProcess(szName, [&](pid_t pid) {
+            if (pid != getpid() && kill(pid, nSignal) == 0) {
+                ++nSignalled;
+            }
+        });
+        return blRead ? nSignalled : Fail(TLIBC_ERR_READ, __LINE__);
+    });
+}
+
+pid_t TLIBCReadPidFile(const char* szPath) {
+    return AtBorder(pid_t{-1}, [&] {
+        if (szPath == nullptr) {
+            return pid_t{Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__)};
+        }
+        const std::optional<std::string> szText = tavo::ReadFile(szPath);
+        const long nPid = szText ? std::strtol(szText->c_str(), nullptr, 10) : -1;
+        return nPid >= 1 && nPid <= INT32_MAX ? static_cast<pid_t>(nPid) : pid_t{Fail(TLIBC_ERR_NOT_FOUND, __LINE__)};
+    });
+}
+
+int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4) {
+    if (szPath == nullptr || *szPath == '\0') {
+        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+    }
+    const char* rgszGiven[] = {szPath, szArg1, szArg2, szArg3, szArg4, nullptr};
+    char* rgszArguments[std::size(rgszGiven)] = {};
+    for (size_t i = 0; i < std::size(rgszGiven) && rgszGiven[i] != nullptr; ++i) {
+        rgszArguments[i] = const_cast<char*>(rgszGiven[i]);
+    }
+    int rgFdPipe[2];
+    if (pipe2(rgFdPipe, O_CLOEXEC) != 0) {
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    Descriptor fdRead(rgFdPipe[0]);
+    Descriptor fdWrite(rgFdPipe[1]);
+    const pid_t pid = fork();
+    if (pid < 0) {
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    if (pid == 0) {
+        // A child of a child belongs to init, which takes care of its end.
+        setsid();
+        const pid_t pidProgram = fork();
+        if (pidProgram == 0) {
+            BecomeProgram(rgszArguments, rgFdPipe[1]);
+        }
+        _exit(pidProgram < 0 ? 1 : 0);
+    }
+    fdWrite.Reset();
+    const int nChild = WaitFor(pid);
+    int nErrno = 0;
+    ssize_t nRead = 0;
+    while ((nRead = read(fdRead.Get(), &nErrno, sizeof(nErrno))) < 0 && errno == EINTR) {
+    }
+    if (nChild != 0 || nRead != 0) {
+        errno = nErrno;
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    return 0;
+}
+
+int TLIBCSystem(const char* szCommand) {
+    if (szCommand == nullptr) {
+        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+    }
+    char szShell[] = "sh";
+    char szOption[] = "-c";
+    char* const rgszArguments[] = {szShell, szOption, const_cast<char*>(szCommand), nullptr};
+    const pid_t pid = SpawnSetup().Spawn("/bin/sh", rgszArguments);
+    return pid < 0 ? Fail(TLIBC_ERR_EXEC, __LINE__) : WaitFor(pid);
+}

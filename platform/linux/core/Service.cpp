@@ -1,0 +1,79 @@
+// System services by the platform's names: through systemd where it runs, else through /etc/init.d.
+// Relies on systemctl or the init script, started without a shell. Promises: names that are no plain
+// service name are refused; every call ends within half a minute.
+#include <string>
+#include <string_view>
+
+#include "core/Border.h"
+#include "tavo/core.h"
+
+namespace {
+
+constexpr char kFile[] = "platform/linux/core/Service.cpp";
+constexpr int kNameSize = 128;
+
+// Where the system's name differs from the platform's.
+struct Alias {
+    std::string_view szPlatform;
+    const char* szSystem;
+};
+constexpr Alias kAliases[] = {{"avahi", "avahi-daemon"}, {"tavorelayd", "tavorelayd"}};
+
+bool IsServiceName(std::string_view szName) {
+    constexpr std::string_view kAllowed = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789_.@-";
+    return !szName.empty() && szName.size() < kNameSize && szName.front() != '-' && szName.front() != '.' &&
+           szName.find_first_not_of(kAllowed) == std::string_view::npos;
+}
+
+// The system's name of a service; empty for a bad one.
+std::string SystemName(const char* szName) {
+    if (szName == nullptr || !IsServiceName(szName)) {
+        return "";
+    }
+    const char* szDefault = szName;
+    for (const Alias& alias : kAliases) {
+        if (alias.szPlatform == szName) {
+            szDefault = alias.szSystem;
+        }
+    }
+    char szSystem[kNameSize];
+    TLIBPlatformSettingGet("services", szName, szDefault, szSystem, sizeof(szSystem));
+    return IsServiceName(szSystem) ? szSystem : "";
+}
+
+// Exit status of the service manager's verb; -1 for a bad name or no manager.
+int Control(const char* szName, const char* szSystemdVerb, const char* szInitVerb) {
+    return tavo::AtBorder(-1, [&] {
+        const std::string szSystem = SystemName(szName);
+        if (szSystem.empty()) {
+            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
+            return -1;
+        }
+        if (TLIBCFileExist("/run/systemd/system") == 1) {
+            return TLIBCSystem(("timeout 30 systemctl " + std::string(szSystemdVerb) + " " + szSystem +
+                                ".service >/dev/null 2>&1 </dev/null")
+                                   .c_str());
+        }
+        const std::string szScript = "/etc/init.d/" + szSystem;
+        if (TLIBCFileExist(szScript.c_str()) != 1) {
+            TLIBCErrSet(TLIBC_ERR_NOT_FOUND, kFile, __LINE__);
+            return -1;
+        }
+        return TLIBCSystem(("timeout 30 " + szScript + " " + szInitVerb + " >/dev/null 2>&1 </dev/null").c_str());
+    });
+}
+
+}  // namespace
+
+int TLIBServiceIsRunning(const char* szName) {
+    const int nStatus = Control(szName, "is-active", "status");
+    return nStatus < 0 ? -1 : (nStatus == 0 ? 1 : 0);
+}
+
+int TLIBServiceReload(const char* szName) {
+    return Control(szName, "reload", "reload") == 0 ? 0 : -1;
+}
+
+int TLIBServiceRestart(const char* szName) {
+    return Control(szName, "restart", "restart") == 0 ? 0 : -1;
+}

@@ -1,0 +1,55 @@
+// The one reader and writer of the platform's text files: sectioned files and key files.
+// Relies on POSIX files only. Promises: what was written is read back unchanged, whatever it holds; a
+// reader never sees half a file; a failed write leaves the old file and nothing beside it.
+#pragma once
+
+#include <sys/types.h>
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "core/Export.h"
+
+namespace tavo {
+
+inline constexpr mode_t kPrivateMode = 0600;
+
+struct Pair {
+    std::string szKey;
+    std::string szValue;
+};
+
+struct Section {
+    std::string szName;
+    std::vector<Pair> rgPairs;
+};
+
+// The whole file. Nothing, with the last error set, when it is missing, unreadable, no regular file or
+// larger than 16 MiB.
+TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath);
+
+// Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
+// (nNewMode for a new file), renamed over it. A link is followed. False with the last error set.
+TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_view szText,
+                                       mode_t nNewMode = kPrivateMode);
+
+// All sections in file order. Nothing when any line is neither section, pair, comment nor blank.
+std::optional<std::vector<Section>> ParseSections(std::string_view szText);
+std::string FormatSections(const std::vector<Section>& rgSections);
+
+// One line of a key file as key and value; nothing for blank lines, comments and what is neither.
+std::optional<Pair> ParseKeyLine(std::string_view szLine);
+// The value as it stands between quotes, for a shell to source: `$` and backtick are escaped too.
+std::string QuoteForShell(std::string_view szValue);
+
+// Lines without their ends; "\r\n" counts as one end.
+std::vector<std::string_view> SplitLines(std::string_view szText);
+std::string_view Trim(std::string_view szText);
+
+// For texts from the network: control characters dropped, cut at nMax bytes.
+TAVO_PLATFORM_API std::string PrintableText(std::string_view szText, size_t nMax);
+
+}  // namespace tavo

@@ -1,0 +1,84 @@
+// The event log: what the user must see, one line an event. Relies on appending to a file.
+// Promises: one write a line, so that two processes never mix theirs; control characters are dropped.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <ctime>
+#include <string>
+
+#include "core/Border.h"
+#include "core/Descriptor.h"
+#include "core/TextFile.h"
+#include "tavo/log.h"
+
+namespace {
+
+constexpr char kFile[] = "platform/linux/log/EventLog.cpp";
+constexpr char kDirectory[] = "/var/log/tavo";
+constexpr char kEventLog[] = "/var/log/tavo/event.log";
+constexpr size_t kTextSize = 4096;
+constexpr int kSystemEvents = 1;
+
+int Fail(int nErr, int nLine) {
+    TLIBCErrSet(nErr, kFile, nLine);
+    return -1;
+}
+
+const char* LevelName(int nLevel) {
+    switch (nLevel) {
+        case 1:
+            return "info";
+        case 2:
+            return "warning";
+        default:
+            return "error";
+    }
+}
+
+// The catalogue: a message, and the place where the first text goes at its end.
+const char* Message(unsigned nEvent) {
+    switch (nEvent) {
+        case TAVO_EVENT_PF_CONFLICT:
+            return "The router already uses these ports for something else: ";
+        case TAVO_EVENT_PF_ADD_FAILED:
+            return "The router refused to forward these ports: ";
+        default:
+            return "Event: ";
+    }
+}
+
+std::string Now() {
+    const std::time_t nNow = std::time(nullptr);
+    std::tm parts = {};
+    char szTime[32] = {};
+    localtime_r(&nNow, &parts);
+    std::strftime(szTime, sizeof(szTime), "%Y-%m-%dT%H:%M:%S%z", &parts);
+    return szTime;
+}
+
+}  // namespace
+
+int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
+                const char* szText4) {
+    return tavo::AtBorder(-1, [&] {
+        if (nKind != kSystemEvents || nLevel < 1 || nLevel > 3) {
+            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        }
+        char szEvent[16];
+        std::snprintf(szEvent, sizeof(szEvent), "0x%08X", nEvent);
+        std::string szLine = Now() + " " + LevelName(nLevel) + " " + szEvent + " " + Message(nEvent);
+        for (const char* szText : {szText1, szText2, szText3, szText4}) {
+            if (szText != nullptr && *szText != '\0') {
+                szLine += (szLine.ends_with(": ") ? "" : " ") + tavo::PrintableText(szText, kTextSize);
+            }
+        }
+        szLine += "\n";
+        mkdir(kDirectory, 0755);
+        const tavo::Descriptor fd(open(kEventLog, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0640));
+        if (fd.Get() < 0 || write(fd.Get(), szLine.data(), szLine.size()) != static_cast<ssize_t>(szLine.size())) {
+            return Fail(TLIBC_ERR_WRITE, __LINE__);
+        }
+        return 0;
+    });
+}

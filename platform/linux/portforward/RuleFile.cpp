@@ -1,0 +1,244 @@
+// Rule and router files as lists of nodes, and the counts that the capacity checks use.
+// Relies on TextFile and on the description of the router for the count of jobs.
+// Promises: a list is whole or absent; a file is replaced whole or left alone.
+#include <climits>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+#include "core/Border.h"
+#include "portforward/ConfList.h"
+#include "portforward/PortText.h"
+
+namespace {
+
+constexpr char kFile[] = "platform/linux/portforward/RuleFile.cpp";
+constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
+constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+constexpr int kMaxPort = 65535;
+
+using tavo::AtBorder;
+using tavo::ConfList;
+
+TAVO_PF_CONF* Load(const char* szPath) {
+    return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] { return tavo::LoadConfList(szPath).release(); });
+}
+
+bool IsListed(std::string_view szName, std::string_view szIdList) {
+    constexpr std::string_view kSeparators = ", \t";
+    for (size_t nStart = 0; nStart < szIdList.size();) {
+        const size_t nEnd = std::min(szIdList.find_first_of(kSeparators, nStart), szIdList.size());
+        if (nEnd > nStart && szIdList.substr(nStart, nEnd - nStart) == szName) {
+            return true;
+        }
+        nStart = nEnd + 1;
+    }
+    return false;
+}
+
+TAVO_PF_CONF* LoadListed(const char* szPath, const char* szIdList) {
+    ConfList pList(Load(szPath));
+    if (szIdList == nullptr || std::strspn(szIdList, ", \t") == std::strlen(szIdList)) {
+        return pList.release();
+    }
+    TAVO_PF_CONF* pHead = pList.release();
+    for (TAVO_PF_CONF** ppNode = &pHead; *ppNode != nullptr;) {
+        if (IsListed((*ppNode)->szSection, szIdList)) {
+            ppNode = &(*ppNode)->pNext;
+            continue;
+        }
+        ConfList pDropped(*ppNode);
+        *ppNode = pDropped->pNext;
+        pDropped->pNext = nullptr;
+    }
+    return pHead;
+}
+
+std::string Value(const TAVO_PF_CONF* pConf, const char* szKey) {
+    const char* szValue = pConf->pHash == nullptr ? nullptr : TLIBCSzHashGetValue(pConf->pHash, szKey);
+    return szValue == nullptr ? "" : szValue;
+}
+
+std::vector<tavo::Section> Sections(const TAVO_PF_CONF* pHead) {
+    std::vector<tavo::Section> rgSections;
+    for (const TAVO_PF_CONF* pConf = pHead; pConf != nullptr; pConf = pConf->pNext) {
+        rgSections.push_back({pConf->szSection, {}});
+        const char* szKey = nullptr;
+        const char* szValue = nullptr;
+        for (int i = 0; pConf->pHash != nullptr && TLIBCSzHashGetAt(pConf->pHash, i, &szKey, &szValue) == 1; ++i) {
+            rgSections.back().rgPairs.push_back({szKey, szValue == nullptr ? "" : szValue});
+        }
+    }
+    return rgSections;
+}
+
+// Whether every page of the router in front takes both protocols in one job. A router that nobody
+// described is taken to do so.
+bool TakesBothAtOnce(const char* szGwRouterIP) {
+    const ConfList pRouters(Load(kRouterConf));
+    for (const TAVO_PF_CONF* pRouter = pRouters.get(); pRouter != nullptr; pRouter = pRouter->pNext) {
+        TAVO_PF_CONF* pDescRaw = nullptr;
+        TAVO_ROUTER_SCRIPT* pOps = nullptr;
+        if (std::strcmp(pRouter->szSection, szGwRouterIP) != 0 ||
+            TAVOPFRouterDBLoadDescAndOpsByIp(pRouter, &pDescRaw, &pOps) < 0) {
+            continue;
+        }
+        const ConfList pDesc(pDescRaw);
+        TAVORouterScriptFree(pOps);
+        for (const TAVO_PF_CONF* pPage = pDesc.get(); pPage != nullptr; pPage = pPage->pNext) {
+            const bool blPage = std::strcmp(pPage->szSection, "PF port page") == 0 ||
+                                std::strcmp(pPage->szSection, "PF range page") == 0;
+            if (blPage && pPage->pHash != nullptr && TLIBCSzHashGetValue(pPage->pHash, "tcp_udp") == nullptr) {
+                return false;
+            }
+        }
+    }
+    return true;
+}
+
+// Jobs of one kind that one rule needs; negative when its texts cannot be read.
+int CountJobs(const TAVO_PF_CONF* pConf, bool blRange, bool blBothAtOnce) {
+    const auto rgRanges = tavo::ParsePortRanges(Value(pConf, "r_port"));
+    const auto protocols = tavo::ParseProtocol(Value(pConf, "protocol name"));
+    if (!rgRanges || !protocols) {
+        TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
+        return -1;
+    }
+    int nItems = 0;
+    for (const tavo::PortRange& range : *rgRanges) {
+        nItems += (range.nFirst != range.nLast) == blRange ? 1 : 0;
+    }
+    return protocols->blTcp && protocols->blUdp && !blBothAtOnce ? 2 * nItems : nItems;
+}
+
+}  // namespace
+
+namespace tavo {
+
+ConfList MakeConfList(const std::vector<Section>& rgSections) {
+    ConfList pHead;
+    TAVO_PF_CONF** ppTail = nullptr;
+    for (const Section& section : rgSections) {
+        ConfList pNode(static_cast<TAVO_PF_CONF*>(std::calloc(1, sizeof(TAVO_PF_CONF))));
+        if (!pNode) {
+            throw std::bad_alloc();
+        }
+        std::snprintf(pNode->szSection, sizeof(pNode->szSection), "%s", section.szName.c_str());
+        if (!section.rgPairs.empty()) {
+            pNode->pHash = TLIBCSzHashAlloc(static_cast<int>(section.rgPairs.size()));
+        }
+        for (const Pair& pair : section.rgPairs) {
+            if (TLIBCSzHashSetValue(pNode->pHash, pair.szKey.c_str(), pair.szValue.c_str()) < 0) {
+                throw std::bad_alloc();
+            }
+        }
+        TAVO_PF_CONF* pRaw = pNode.release();
+        if (ppTail == nullptr) {
+            pHead.reset(pRaw);
+        } else {
+            *ppTail = pRaw;
+        }
+        ppTail = &pRaw->pNext;
+    }
+    return pHead;
+}
+
+ConfList LoadConfList(const char* szPath) {
+    const std::optional<std::string> szText = ReadFile(szPath);
+    if (!szText) {
+        return nullptr;
+    }
+    const std::optional<std::vector<Section>> rgSections = ParseSections(*szText);
+    if (!rgSections) {
+        return nullptr;
+    }
+    TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
+    return MakeConfList(*rgSections);
+}
+
+}  // namespace tavo
+
+void TAVOPFConfFree(TAVO_PF_CONF* pHead) {
+    while (pHead != nullptr) {
+        TAVO_PF_CONF* pNext = pHead->pNext;
+        TLIBCSzHashFree(pHead->pHash);
+        std::free(pHead);
+        pHead = pNext;
+    }
+}
+
+TAVO_PF_CONF* TAVOPFRuleGet() {
+    return Load(kRuleConf);
+}
+
+TAVO_PF_CONF* TAVOPFTestRuleGet() {
+    return Load(kTestRuleConf);
+}
+
+TAVO_PF_CONF* TAVOPFRuleGetByIdList(const char* szIdList) {
+    return LoadListed(kRuleConf, szIdList);
+}
+
+TAVO_PF_CONF* TAVOPFTestRuleGetByIdList(const char* szIdList) {
+    return LoadListed(kTestRuleConf, szIdList);
+}
+
+int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
+    return AtBorder(-1, [&] {
+        if (szPath == nullptr || *szPath == '\0') {
+            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
+            return -1;
+        }
+        return tavo::WriteFileAtomic(szPath, tavo::FormatSections(Sections(pHead))) ? 0 : -1;
+    });
+}
+
+TAVO_PF_CONF* TAVOPFGwRouterConfGet() {
+    return Load(kRouterConf);
+}
+
+int TAVOGwRouterConfSet(const TAVO_PF_CONF* pHead) {
+    return TAVOPFRuleBuildByPath(pHead, kRouterConf);
+}
+
+int TLIBPFCountRuleConf(const TAVO_PF_CONF* pHead, int nEnabledOnly) {
+    return AtBorder(-1, [&] {
+        int nRules = 0;
+        for (const TAVO_PF_CONF* pConf = pHead; pConf != nullptr; pConf = pConf->pNext) {
+            if (nRules == INT_MAX) {
+                return -1;
+            }
+            nRules += nEnabledOnly == 0 || Value(pConf, "enabled") == "1" ? 1 : 0;
+        }
+        return nRules;
+    });
+}
+
+int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, const char* szJob) {
+    return AtBorder(-1, [&] {
+        const bool blRange = szJob != nullptr && std::strcmp(szJob, "PF add range") == 0;
+        if (szGwRouterIP == nullptr || szJob == nullptr || (!blRange && std::strcmp(szJob, "PF add port") != 0)) {
+            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
+            return -1;
+        }
+        const bool blBothAtOnce = TakesBothAtOnce(szGwRouterIP);
+        int nJobs = 0;
+        for (const TAVO_PF_CONF* pConf = pHead; pConf != nullptr; pConf = pConf->pNext) {
+            if (Value(pConf, "enabled") != "1") {
+                continue;
+            }
+            const int nOfRule = CountJobs(pConf, blRange, blBothAtOnce);
+            if (nOfRule < 0) {
+                return -1;
+            }
+            nJobs += nOfRule;
+        }
+        return nJobs;
+    });
+}
+
+int TAVOPFIsValidPortNo(int nPort) {
+    return nPort >= 1 && nPort <= kMaxPort ? 1 : 0;
+}

@@ -1,0 +1,70 @@
+// Writes the outcome of the user's own compatibility test. Relies on the platform's section files.
+// Promises: after a successful Sync() the file holds this record and no other.
+#include "common.h"
+
+#include <unistd.h>
+
+namespace {
+
+constexpr char kFile[] = "src/RouterUpnpDBUserWriter.cpp";
+constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
+
+using tavo::lib::AtBorder;
+using tavo::lib::LogError;
+
+}  // namespace
+
+RouterUpnpDBUserWriter::RouterUpnpDBUserWriter(const std::string& section) : mSzSection(section), mPSection(nullptr) {}
+
+RouterUpnpDBUserWriter::~RouterUpnpDBUserWriter() {
+    TAVOPFConfFree(mPSection);
+}
+
+bool RouterUpnpDBUserWriter::Init() {
+    if (mPSection == nullptr) {
+        mPSection =
+            tavo::lib::NewSection(mSzSection, "%s:%d malloc failed", "%s:%d hash malloc failed", kFile, __LINE__)
+                .release();
+    }
+    return mPSection != nullptr;
+}
+
+bool RouterUpnpDBUserWriter::SetSupport(const std::string& support) {
+    if (!Init()) {
+        LogError("%s:%d init failed", kFile, __LINE__);
+        return false;
+    }
+    if (TLIBCSzHashSetValue(mPSection->pHash, "support", support.c_str()) < 0) {
+        LogError("%s:%d save config failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+bool RouterUpnpDBUserWriter::SetMaxRule(int nMaxRule) {
+    return AtBorder(false, [&] {
+        if (!Init()) {
+            LogError("%s:%d init failed", kFile, __LINE__);
+            return false;
+        }
+        if (TLIBCSzHashSetValue(mPSection->pHash, "max", std::to_string(nMaxRule).c_str()) < 0) {
+            LogError("%s:%d save config failed", kFile, __LINE__);
+            return false;
+        }
+        return true;
+    });
+}
+
+bool RouterUpnpDBUserWriter::Sync() {
+    if (TLIBCFileExist(kUserDb) == 1) {
+        unlink(kUserDb);
+    }
+    const char* szSection = mPSection == nullptr ? mSzSection.c_str() : mPSection->szSection;
+    const int nAdded = TLIBCFileAddSection(kUserDb, szSection, mPSection == nullptr ? nullptr : mPSection->pHash, 0);
+    if (nAdded != 1) {
+        LogError("%s:%d fail set section into [%s] ret=%d[0x%04X %s:%d]", kFile, __LINE__, kUserDb, nAdded,
+                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
+        return false;
+    }
+    return true;
+}

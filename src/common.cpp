@@ -1,0 +1,504 @@
+// The helpers that the library's files share, the two lock primitives, the gateway address, the names
+// of router models and the accessors of a parsed rule section. Relies on the platform's files, network
+// and port-forward library. Promises: outputs are untouched on failure unless stated, nothing is thrown.
+#include "common.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <cstdarg>
+#include <cstdlib>
+#include <cstring>
+
+#include "tavo/net.h"
+
+namespace {
+
+constexpr char kFile[] = "src/common.cpp";
+
+using tavo::lib::LogError;
+
+constexpr int kLockFileMode = 0600;
+constexpr size_t kAddressSize = 16;
+constexpr size_t kBrandSize = 512;
+constexpr size_t kModelSize = 512;
+constexpr size_t kVersionSize = 1024;
+constexpr size_t kPathSize = 4096;
+constexpr size_t kToolLineSize = 1024;
+
+// The two refusals that every accessor of a rule section begins with.
+bool HasHash(const TAVO_PF_CONF* pConf) {
+    if (pConf == nullptr) {
+        LogError("%s:%d pConf shall not be NULL", kFile, __LINE__);
+        return false;
+    }
+    if (pConf->pHash == nullptr) {
+        LogError("%s:%d section shall not be empty", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+struct PipeCloser {
+    void operator()(FILE* pPipe) const { pclose(pPipe); }
+};
+
+void RenameLogged(const char* szFrom, const char* szTo, int nLine) {
+    if (rename(szFrom, szTo) != 0) {
+        LogError("%s:%d rename(%s, %s) failed ", kFile, nLine, szFrom, szTo);
+    }
+}
+
+struct RecordFields {
+    std::string szServiceID;
+    std::string szServiceName;
+    std::string szRouterPort;
+    std::string szSrcPort;
+    std::string szProtocol;
+    std::string szRuleID;
+    bool blEnable = false;
+};
+
+// Reads one rule into the texts, which keep what the rule does not have.
+bool ReadFields(RecordFields& fields, const TAVO_PF_CONF* pConf) {
+    if (PF_CONF::IsRuleEnable(fields.blEnable, pConf) == 0) {
+        LogError("%s:%d IsRuleEnable() failed", kFile, __LINE__);
+        return false;
+    }
+    if (PF_CONF::GetRuleServiceID(fields.szServiceID, pConf) == 0) {
+        LogError("%s:%d GetRuleServiceID() failed", kFile, __LINE__);
+        return false;
+    }
+    PF_CONF::GetRuleServiceName(fields.szServiceName, pConf);
+    if (PF_CONF::GetRulePort(fields.szRouterPort, fields.szSrcPort, pConf) == 0) {
+        LogError("%s:%d GetRulePort() failed", kFile, __LINE__);
+        return false;
+    }
+    if (PF_CONF::GetRuleProtocol(fields.szProtocol, pConf) == 0) {
+        LogError("%s:%d GetRuleProtocol() failed", kFile, __LINE__);
+        return false;
+    }
+    if (PF_CONF::GetRuleID(fields.szRuleID, pConf) == 0) {
+        LogError("%s:%d GetRuleID() failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+void FillRecord(__tag_TAVO_ROUTER_RULE& rule, const RecordFields& fields) {
+    using tavo::lib::FillText;
+    FillText(rule.szRuleID, fields.szRuleID);
+    rule.blEnable = fields.blEnable;
+    FillText(rule.szProtocol, fields.szProtocol);
+    FillText(rule.szRouterPort, fields.szRouterPort);
+    FillText(rule.szSrcPort, fields.szSrcPort);
+    FillText(rule.szServiceID, fields.szServiceID);
+    FillText(rule.szServiceName, fields.szServiceName);
+}
+
+// Runs the daemon's program; it writes its own pid file.
+bool ExecDaemon(const tavo::lib::DaemonControl& control) {
+    unlink(control.szPidFile);
+    char szCommand[tavo::lib::kCommandSize] = {};
+    const int nLength = std::snprintf(szCommand, sizeof(szCommand), "%s%s", tavo::lib::kSbinDir, control.szName);
+    if (nLength < 0 || TLIBCExec(szCommand, nullptr, nullptr, nullptr, nullptr) == -1) {
+        LogError("%s:%d exec %s daemon failed", control.szFile, __LINE__, control.szName);
+        return false;
+    }
+    return true;
+}
+
+bool HupDaemon(const tavo::lib::DaemonControl& control, pid_t pid) {
+    if (kill(pid, SIGHUP) != -1) {
+        return true;
+    }
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat"  // "%m" is the C library's own
+    LogError("%s:%d send SIGHUP to %s failed errno=%m", control.szFile, __LINE__, control.szName);
+#pragma GCC diagnostic pop
+    LogError("%s:%d HupDaemon() %s failed", control.szFile, __LINE__, control.szName);
+    return false;
+}
+
+// A daemon whose pid is not known: signalled by name, and started anew.
+bool RestartDaemon(const tavo::lib::DaemonControl& control) {
+    TLIBCKill(control.szName, SIGHUP);
+    if (ExecDaemon(control)) {
+        return true;
+    }
+    LogError("%s:%d StartDaemon() failed", control.szFile, __LINE__);
+    LogError("%s:%d RestartDaemon() %s failed", control.szFile, __LINE__, control.szName);
+    return false;
+}
+
+bool StartFresh(const tavo::lib::DaemonControl& control) {
+    if (ExecDaemon(control)) {
+        return true;
+    }
+    LogError("%s:%d StartDaemon() %s failed", control.szFile, __LINE__, control.szName);
+    return false;
+}
+
+int ReadText(std::string& szValue, const char* szKey, const TAVO_PF_CONF* pConf) {
+    const char* szStored = TLIBCSzHashGetValue(pConf->pHash, szKey);
+    if (szStored == nullptr) {
+        return 0;
+    }
+    szValue = szStored;
+    return 1;
+}
+
+}  // namespace
+
+namespace tavo::lib {
+
+void LogError(const char* szFormat, ...) {
+    const int nErrno = errno;
+    char* szLine = nullptr;
+    va_list args;
+    va_start(args, szFormat);
+    const int nLength = vasprintf(&szLine, szFormat, args);
+    va_end(args);
+    if (nLength >= 0) {
+        syslog(LOG_ERR, "%s", szLine);
+        std::free(szLine);
+    }
+    errno = nErrno;
+}
+
+int ToInt(const char* szText) {
+    return static_cast<int>(std::clamp(std::strtol(szText, nullptr, 10), long{INT_MIN}, long{INT_MAX}));
+}
+
+ConfList NewSection(const std::string& szName, const char* szNoNode, const char* szNoHash, const char* szFile,
+                    int nLine) {
+    ConfList pNode(static_cast<TAVO_PF_CONF*>(std::calloc(1, sizeof(TAVO_PF_CONF))));
+    if (!pNode) {
+        LogError(szNoNode, szFile, nLine);
+        return nullptr;
+    }
+    pNode->pHash = TLIBCSzHashAlloc(kHashSize);
+    if (pNode->pHash == nullptr) {
+        LogError(szNoHash, szFile, nLine);
+        return nullptr;
+    }
+    std::snprintf(pNode->szSection, sizeof(pNode->szSection), "%s", szName.c_str());
+    return pNode;
+}
+
+bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
+    std::string szAside = std::string(szPath) + "XXXXXX";
+    // The name is only ever renamed to, never opened, and its directory is root's own.
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wdeprecated-declarations"
+    mktemp(szAside.data());
+#pragma GCC diagnostic pop
+    if (TLIBCFileExist(szPath) == 1 && rename(szPath, szAside.c_str()) != 0) {
+        LogError("%s:%d rename(%s, %s) failed ", kFile, __LINE__, szPath, szAside.c_str());
+        if (TLIBCFileExist(szAside.c_str()) == 1) {
+            RenameLogged(szAside.c_str(), szPath, __LINE__);
+        }
+        return false;
+    }
+    const bool blWritten = fnWrite();
+    if (!blWritten) {
+        LogError("%s:%d save config failed", kFile, __LINE__);
+    }
+    if (TLIBCFileExist(szAside.c_str()) == 1) {
+        if (blWritten) {
+            unlink(szAside.c_str());
+        } else {
+            RenameLogged(szAside.c_str(), szPath, __LINE__);
+        }
+    }
+    return blWritten;
+}
+
+bool StartDaemonOf(const DaemonControl& control) {
+    const bool blAlive = TLIBCIsProcAlive(control.szName) == 1;
+    unlink(kProgressMarker);
+    if (TLIBCIsProcAlive(control.szOther) > 0) {
+        TLIBCKill(control.szOther, SIGHUP);
+    }
+    bool blStarted = false;
+    if (!blAlive) {
+        blStarted = StartFresh(control);
+    } else if (const pid_t pid = TLIBCReadPidFile(control.szPidFile); pid >= 1) {
+        blStarted = HupDaemon(control, pid);
+    } else {
+        blStarted = RestartDaemon(control);
+    }
+    if (blStarted) {
+        TLIBCFileTouch(kProgressMarker);
+    }
+    return blStarted;
+}
+
+}  // namespace tavo::lib
+
+using tavo::lib::AtBorder;
+
+int lock_file(const char* szPath, int& fd) {
+    fd = open(szPath, O_RDWR | O_CREAT | O_NONBLOCK, kLockFileMode);
+    if (fd < 0) {
+        return 0;
+    }
+    return flock(fd, LOCK_EX | LOCK_NB) == 0 ? 1 : 0;
+}
+
+void unlock_file(int fd) {
+    if (fd < 0) {
+        return;
+    }
+    flock(fd, LOCK_UN);
+    close(fd);
+}
+
+int GetGatewayIP(std::string& ip) {
+    return AtBorder(0, [&] {
+        char szGateway[kAddressSize] = {};
+        if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0) {
+            LogError("%s:%d cannot get gateway router ip", kFile, __LINE__);
+            return 0;
+        }
+        if (BlTLIBIsIpAddr(szGateway) == 0 || std::strcmp(szGateway, "0.0.0.0") == 0) {
+            LogError("%s:%d error gateway router ip: %s", kFile, __LINE__, szGateway);
+            return 0;
+        }
+        ip = szGateway;
+        return 1;
+    });
+}
+
+bool SplitRouterName(char* szName, std::string& brand, std::string& model, std::string& version) {
+    return AtBorder(false, [&] {
+        const std::string szWhole = szName == nullptr ? "" : szName;
+        const size_t nSeparator = szWhole.find(": ");
+        if (nSeparator == std::string::npos) {
+            LogError("%s:%d incorrect information", kFile, __LINE__);
+            return false;
+        }
+        const std::string szBrand = szWhole.substr(0, std::min(nSeparator, kBrandSize - 1));
+        const size_t nModel = nSeparator + 2;
+        const size_t nOpen = szWhole.find('(', nSeparator);
+        const size_t nModelLength = nOpen == std::string::npos ? nOpen : nOpen - nModel;
+        const std::string szModel = szWhole.substr(nModel, std::min(nModelLength, kModelSize - 1));
+        char szVersion[kVersionSize] = {};
+        if (nOpen != std::string::npos) {
+            const std::string szRest = szWhole.substr(nOpen + 1);
+            std::snprintf(szVersion, sizeof(szVersion), "%s", szRest.substr(0, szRest.rfind(')')).c_str());
+        } else {
+            char szPath[kPathSize] = {};
+            std::snprintf(szPath, sizeof(szPath), "%s/%s/%s/%s", tavo::lib::kRouterDbDir, szBrand.c_str(),
+                          szModel.c_str(), "generic");
+            if (TLIBCFileGetKeyValue(szPath, "version", szVersion, sizeof(szVersion), 0) < 1) {
+                LogError("%s:%d incorrect information", kFile, __LINE__);
+                return false;
+            }
+        }
+        brand = szBrand;
+        model = szModel;
+        version = szVersion;
+        return true;
+    });
+}
+
+bool IsGenericRouterName(bool& isGeneric, char* szName) {
+    return AtBorder(false, [&] {
+        const char* szSeparator = szName == nullptr ? nullptr : std::strstr(szName, ": ");
+        if (szSeparator == nullptr) {
+            LogError("%s:%d incorrect information", kFile, __LINE__);
+            return false;
+        }
+        isGeneric = std::strchr(szSeparator, '(') == nullptr;
+        return true;
+    });
+}
+
+int IGetCurrSyntaxVersion() {
+    static constexpr char kKey[] = "syntax version";
+    const std::unique_ptr<FILE, PipeCloser> pTool(popen("/usr/tavo/bin/tavoportforward --version", "r"));
+    if (!pTool) {
+        LogError("%s:%d popen tavoportforward error", kFile, __LINE__);
+        return -1;
+    }
+    int nVersion = -1;
+    char szLine[kToolLineSize];
+    while (std::fgets(szLine, sizeof(szLine), pTool.get()) != nullptr) {
+        if (std::strncmp(szLine, kKey, sizeof(kKey) - 1) != 0) {
+            continue;
+        }
+        const char* szNumber = std::strchr(szLine + sizeof(kKey) - 1, '=');
+        if (szNumber != nullptr) {
+            nVersion = tavo::lib::ToInt(szNumber + 1);
+        }
+    }
+    return nVersion;
+}
+
+namespace PF_CONF {
+
+int IsRuleEnable(bool& blEnable, const _tag_tavo_pf_conf* pConf) {
+    if (!HasHash(pConf)) {
+        return 0;
+    }
+    const char* szEnabled = TLIBCSzHashGetValue(pConf->pHash, "enabled");
+    if (szEnabled == nullptr) {
+        LogError("%s:%d get rule enable failed", kFile, __LINE__);
+        return 0;
+    }
+    blEnable = std::strcmp(szEnabled, "1") == 0;
+    return 1;
+}
+
+int GetRuleID(std::string& id, const _tag_tavo_pf_conf* pConf) {
+    return AtBorder(0, [&] {
+        if (pConf == nullptr) {
+            LogError("%s:%d pConf shall not be NULL", kFile, __LINE__);
+            return 0;
+        }
+        id = pConf->szSection;
+        return 1;
+    });
+}
+
+int GetRuleProtocol(std::string& protocol, const _tag_tavo_pf_conf* pConf) {
+    return AtBorder(0, [&] {
+        if (!HasHash(pConf)) {
+            return 0;
+        }
+        if (ReadText(protocol, "protocol name", pConf) == 0) {
+            LogError("%s:%d get protocol failed", kFile, __LINE__);
+            return 0;
+        }
+        return 1;
+    });
+}
+
+int GetRuleServiceID(std::string& serviceID, const _tag_tavo_pf_conf* pConf) {
+    return AtBorder(0, [&] {
+        if (!HasHash(pConf)) {
+            return 0;
+        }
+        if (ReadText(serviceID, "service_id", pConf) == 0) {
+            serviceID.clear();
+        }
+        return 1;
+    });
+}
+
+int GetRuleServiceName(std::string& serviceName, const _tag_tavo_pf_conf* pConf) {
+    return AtBorder(0, [&] {
+        if (!HasHash(pConf)) {
+            return 0;
+        }
+        ReadText(serviceName, "service", pConf);
+        return 1;
+    });
+}
+
+int GetRulePort(std::string& routerPort, std::string& srcPort, const _tag_tavo_pf_conf* pConf) {
+    return AtBorder(0, [&] {
+        if (!HasHash(pConf)) {
+            return 0;
+        }
+        std::string szSrcPort;
+        std::string szRouterPort;
+        if (ReadText(szSrcPort, "s_port", pConf) == 0) {
+            LogError("%s:%d get rule src port failed", kFile, __LINE__);
+            return 0;
+        }
+        if (ReadText(szRouterPort, "r_port", pConf) == 0) {
+            LogError("%s:%d get rule router port failed", kFile, __LINE__);
+            return 0;
+        }
+        routerPort = szRouterPort;
+        srcPort = szSrcPort;
+        return 1;
+    });
+}
+
+int GetRuleInfo(std::string& id, bool& blEnable, std::string& routerPort, std::string& srcPort, std::string& protocol,
+                std::string& serviceID, [[maybe_unused]] std::string& extra, const _tag_tavo_pf_conf* pConf) {
+    if (pConf == nullptr) {
+        LogError("%s:%d pConf is NULL", kFile, __LINE__);
+        return 0;
+    }
+    if (GetRuleID(id, pConf) == 0) {
+        LogError("%s:%d get rule id failed", kFile, __LINE__);
+        return 0;
+    }
+    if (IsRuleEnable(blEnable, pConf) == 0) {
+        LogError("%s:%d get rule protocol failed", kFile, __LINE__);
+        return 0;
+    }
+    if (GetRuleProtocol(protocol, pConf) == 0) {
+        LogError("%s:%d get rule protocol failed", kFile, __LINE__);
+        return 0;
+    }
+    if (GetRulePort(routerPort, srcPort, pConf) == 0) {
+        LogError("%s:%d get rule port failed", kFile, __LINE__);
+        return 0;
+    }
+    GetRuleServiceID(serviceID, pConf);
+    return 1;
+}
+
+int ToArray(int& nCount, __tag_TAVO_ROUTER_RULE** ppRules, const _tag_tavo_pf_conf* pHead) {
+    return AtBorder(0, [&] {
+        if (ppRules == nullptr || *ppRules != nullptr) {
+            LogError("%s:%d pRgRules is NULL or *pRgRules is not NULL", kFile, __LINE__);
+            return 0;
+        }
+        if (pHead == nullptr) {
+            nCount = 0;
+            *ppRules = nullptr;
+            return 1;
+        }
+        nCount = 0;
+        for (const TAVO_PF_CONF* pConf = pHead; pConf != nullptr; pConf = pConf->pNext) {
+            ++nCount;
+        }
+        const size_t nBytes = static_cast<size_t>(nCount) * sizeof(__tag_TAVO_ROUTER_RULE);
+        std::unique_ptr<void, decltype(&std::free)> pBlock(std::malloc(nBytes), &std::free);
+        if (!pBlock) {
+            LogError("%s:%d pArr is NULL", kFile, __LINE__);
+            return 0;
+        }
+        std::memset(pBlock.get(), 0, nBytes);
+        auto* rgRules = static_cast<__tag_TAVO_ROUTER_RULE*>(pBlock.get());
+
+        // One set of texts for all rules: a rule without a service name gets the one of the rule before it.
+        RecordFields fields;
+        int i = 0;
+        for (const TAVO_PF_CONF* pConf = pHead; pConf != nullptr; pConf = pConf->pNext, ++i) {
+            if (!ReadFields(fields, pConf)) {
+                return 0;
+            }
+            if (i >= nCount) {
+                LogError("%s:%d critical error out of array=%d i=%d", kFile, __LINE__, nCount, i);
+                return 0;
+            }
+            FillRecord(rgRules[i], fields);
+        }
+        *ppRules = rgRules;
+        pBlock.release();
+        return 1;
+    });
+}
+
+int FreeArray(__tag_TAVO_ROUTER_RULE* pRules) {
+    if (pRules == nullptr) {
+        LogError("%s:%d pConfHead is NULL", kFile, __LINE__);
+    }
+    std::free(pRules);
+    return 0;
+}
+
+}  // namespace PF_CONF

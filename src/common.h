@@ -1,0 +1,109 @@
+// What the library's own files share: the log line, the fixed paths, file and lock helpers.
+// Relies on the platform's seam headers and the public header.
+// Promises nothing beyond this library: none of these names is exported.
+#pragma once
+
+#include <cstdio>
+#include <exception>
+#include <functional>
+#include <memory>
+#include <new>
+#include <string>
+
+#include "libtavoportmap.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
+
+namespace tavo::lib {
+
+inline constexpr char kRouterLock[] = "/tmp/routerconf.lock";
+inline constexpr char kProgressMarker[] = "/tmp/pfProgress";
+inline constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+inline constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+inline constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
+inline constexpr char kRouterDbDir[] = "/etc.defaults/portforward/routerdb";
+inline constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
+inline constexpr char kUpnpTestDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";
+inline constexpr char kUpnpd[] = "upnpd";
+inline constexpr char kNatpmpd[] = "natpmpd";
+inline constexpr char kForwardTool[] = "tavoportforward";
+inline constexpr char kSbinDir[] = "/usr/tavo/sbin/";
+inline constexpr char kBinDir[] = "/usr/tavo/bin/";
+inline constexpr int kHashSize = 1024;
+inline constexpr size_t kCommandSize = 4096;
+
+// One line of the system log at priority error. Every format begins "%s:%d ": the source path relative
+// to the tree, then the line. errno is kept, so "%m" works and callers may still look at it.
+void LogError(const char* szFormat, ...) __attribute__((format(printf, 1, 2)));
+
+struct ConfListDeleter {
+    void operator()(TAVO_PF_CONF* pHead) const { TAVOPFConfFree(pHead); }
+};
+using ConfList = std::unique_ptr<TAVO_PF_CONF, ConfListDeleter>;
+
+struct HashDeleter {
+    void operator()(TLIBCSzHash* pHash) const { TLIBCSzHashFree(pHash); }
+};
+using Hash = std::unique_ptr<TLIBCSzHash, HashDeleter>;
+
+// Calls fnAnswer at the library's border: nothing that it throws (memory that ran out) crosses.
+template <typename Result, typename Function>
+Result AtBorder(Result failure, Function fnAnswer) noexcept {
+    try {
+        return fnAnswer();
+    } catch (const std::exception&) {
+        return failure;
+    }
+}
+
+// The router lock for one call. Get() tries it without waiting; it is released with the object, also
+// when it was held elsewhere and only a descriptor was opened.
+class RouterLock {
+public:
+    RouterLock() = default;
+    ~RouterLock() { Release(); }
+    RouterLock(const RouterLock&) = delete;
+    RouterLock& operator=(const RouterLock&) = delete;
+
+    bool Get() { return lock_file(kRouterLock, mFd) != 0; }
+    void Release() {
+        unlock_file(mFd);
+        mFd = -1;
+    }
+
+private:
+    int mFd = -1;
+};
+
+// Decimal number of a text as strtol reads it; values outside int are clamped.
+int ToInt(const char* szText);
+
+// Copies with "%s", cut at the field's size. False when the copy failed.
+template <size_t N>
+bool FillText(char (&szField)[N], const std::string& szText) {
+    return std::snprintf(szField, N, "%s", szText.c_str()) >= 0;
+}
+
+// A node with an empty hash, named szName. Null when memory ran out: szNoNode or szNoHash is logged with
+// szFile and nLine. Both formats take the file and the line.
+ConfList NewSection(const std::string& szName, const char* szNoNode, const char* szNoHash, const char* szFile,
+                    int nLine);
+
+// Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new
+// one, and the old one is deleted after success and renamed back after failure. True when fnWrite
+// succeeded; every failure is logged.
+bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite);
+
+// What distinguishes one port-mapping daemon from the other.
+struct DaemonControl {
+    const char* szFile;   // source path of the lines logged
+    const char* szName;   // process and program name
+    const char* szOther;  // the daemon that must stop mapping
+    const char* szPidFile;
+};
+
+// Starts the daemon, or has a running one read its settings again; afterwards the progress marker
+// stands until the daemon has finished. False, with the marker gone, when neither was possible.
+bool StartDaemonOf(const DaemonControl& control);
+
+}  // namespace tavo::lib
