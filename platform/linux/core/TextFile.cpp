@@ -195,8 +195,14 @@ private:
     bool mBlNamed = false;
 };
 
-// Where the file really lies: a link keeps being one.
+// Where the file really lies: a link keeps being one. In a directory that everybody may write to
+// (/tmp), a link may be a trap: there it is replaced and not followed.
 std::string Resolve(const std::string& szPath) {
+    const std::string szDir = szPath.substr(0, szPath.rfind('/') + 1);
+    struct stat status = {};
+    if (stat(szDir.empty() ? "." : szDir.c_str(), &status) == 0 && (status.st_mode & S_ISVTX) != 0) {
+        return szPath;
+    }
     char* szReal = realpath(szPath.c_str(), nullptr);
     std::string szTarget = szReal == nullptr ? szPath : szReal;
     std::free(szReal);
@@ -215,7 +221,7 @@ void FlushDirectory(const std::string& szPath) {
 
 bool KeepOwnerAndMode(int fd, const std::string& szTarget, mode_t nNewMode) {
     struct stat status = {};
-    if (stat(szTarget.c_str(), &status) != 0) {
+    if (lstat(szTarget.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
         return fchmod(fd, nNewMode) == 0;
     }
     struct stat own = {};

@@ -46,8 +46,8 @@ std::optional<Pair> ParseKeyLine(std::string_view szLine);
 std::string QuoteForShell(std::string_view szValue);
 
 // Lines without their ends; "\r\n" counts as one end.
-std::vector<std::string_view> SplitLines(std::string_view szText);
-std::string_view Trim(std::string_view szText);
+TAVO_PLATFORM_API std::vector<std::string_view> SplitLines(std::string_view szText);
+TAVO_PLATFORM_API std::string_view Trim(std::string_view szText);
 
 // For texts from the network: control characters dropped, cut at nMax bytes.
 TAVO_PLATFORM_API std::string PrintableText(std::string_view szText, size_t nMax);

@@ -1,0 +1,221 @@
+// Compares before it writes: an unchanged set costs one listing. Relies on a Router.
+// Promises: see Reconcile.h.
+#include "daemons/common/Reconcile.h"
+
+#include <map>
+#include <optional>
+
+#include "daemons/common/Wanted.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr auto kPassLimit = std::chrono::seconds(150);  // well below the five minutes that a save waits
+constexpr int kTransportTries = 2;                      // silent answers in a row before a pass gives up
+
+using Key = std::pair<std::string, uint16_t>;
+
+Key KeyOf(const RouterMapping& mapping) {
+    return {mapping.szProtocol, mapping.nRouterPort};
+}
+
+class Pass {
+public:
+    Pass(Router& router, const std::string& szBox, LeaseHabit& habit, bool blRenew, const std::function<bool()>& fnStop)
+        : mRouter(router),
+          mSzBox(szBox),
+          mHabit(habit),
+          mBlRenew(blRenew),
+          mFnStop(fnStop),
+          mEnd(std::chrono::steady_clock::now() + kPassLimit) {}
+
+    PassResult Run(const std::vector<RouterMapping>& rgWanted);
+
+private:
+    bool IsOver();
+    bool IsOwn(const RouterMapping& mapping) const {
+        return mapping.szClient == mSzBox && mapping.szDescription.starts_with(kOwnPrefix);
+    }
+    bool Serves(const RouterMapping& entry, const RouterMapping& wanted) const {
+        return entry.szClient == mSzBox && entry.nBoxPort == wanted.nBoxPort && entry.blEnabled;
+    }
+    void RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted);
+    std::string Place(const RouterMapping& wanted);
+    std::string Create(const RouterMapping& wanted);
+    int AddWithLease(RouterMapping mapping);
+    std::string ReadBack(const RouterMapping& wanted);
+    std::string AfterConflict(const RouterMapping& wanted);
+    void NoteLease(uint32_t nLease);
+    int Note(int nCode);
+
+    Router& mRouter;
+    const std::string& mSzBox;
+    LeaseHabit& mHabit;
+    bool mBlRenew;
+    const std::function<bool()>& mFnStop;
+    std::chrono::steady_clock::time_point mEnd;
+    std::map<Key, RouterMapping> mMapTable;
+    PassResult mResult;
+    int mNSilent = 0;
+};
+
+bool Pass::IsOver() {
+    mResult.blStopped = mResult.blStopped || mFnStop();
+    if (std::chrono::steady_clock::now() > mEnd && mResult.nTransport == kRouterOk) {
+        mResult.nTransport = kRouterTimeout;
+    }
+    return mResult.blStopped || mResult.nTransport != kRouterOk;
+}
+
+// Counts answers that did not come; after a few in a row the pass is over.
+int Pass::Note(int nCode) {
+    mNSilent = nCode < 0 ? mNSilent + 1 : 0;
+    if (mNSilent >= kTransportTries || nCode == kRouterUnreachable) {
+        mResult.nTransport = nCode;
+    }
+    return nCode;
+}
+
+void Pass::NoteLease(uint32_t nLease) {
+    if (nLease != 0 && (mResult.nShortestLease == 0 || nLease < mResult.nShortestLease)) {
+        mResult.nShortestLease = nLease;
+    }
+}
+
+PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
+    std::vector<RouterMapping> rgTable;
+    const int nCode = mRouter.List(rgTable);
+    if (nCode != kRouterOk) {
+        mResult.nTransport = nCode < 0 ? nCode : kRouterOk;
+        for (const RouterMapping& wanted : rgWanted) {
+            mResult.rgStatus.emplace_back(MappingName(wanted), CodeText(nCode));
+        }
+        return mResult;
+    }
+    for (RouterMapping& entry : rgTable) {
+        const Key key = KeyOf(entry);
+        mMapTable.emplace(key, std::move(entry));
+    }
+    std::map<Key, RouterMapping> mapWanted;
+    for (const RouterMapping& wanted : rgWanted) {
+        mapWanted.emplace(KeyOf(wanted), wanted);
+    }
+    RemoveUnwanted(mapWanted);
+    for (const RouterMapping& wanted : rgWanted) {
+        const std::string szStatus = IsOver() ? CodeText(mResult.nTransport) : Place(wanted);
+        mResult.rgStatus.emplace_back(MappingName(wanted), szStatus);
+    }
+    return mResult;
+}
+
+// Takes away what we made and the rules no longer ask for.
+void Pass::RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted) {
+    for (auto it = mMapTable.begin(); it != mMapTable.end() && !IsOver();) {
+        const auto wanted = mapWanted.find(it->first);
+        if (!IsOwn(it->second) || (wanted != mapWanted.end() && Serves(it->second, wanted->second))) {
+            ++it;
+            continue;
+        }
+        const int nCode = Note(mRouter.Remove(it->first.first, it->first.second));
+        it = nCode == kRouterOk || nCode == kRouterNoSuchEntry ? mMapTable.erase(it) : std::next(it);
+    }
+}
+
+std::string Pass::Place(const RouterMapping& wanted) {
+    const auto it = mMapTable.find(KeyOf(wanted));
+    if (it == mMapTable.end()) {
+        return Create(wanted);
+    }
+    if (!Serves(it->second, wanted)) {
+        return CodeText(kRouterConflict);
+    }
+    if (!IsOwn(it->second)) {
+        return "1";  // another program of the box made just this one; it is that program's to renew
+    }
+    const bool blDue = mBlRenew && it->second.nLease != 0;
+    if (blDue && Note(AddWithLease(wanted)) == kRouterOk) {
+        return ReadBack(wanted);
+    }
+    NoteLease(it->second.nLease);
+    return "1";
+}
+
+std::string Pass::Create(const RouterMapping& wanted) {
+    const int nCode = Note(AddWithLease(wanted));
+    if (nCode == kRouterConflict) {
+        return AfterConflict(wanted);
+    }
+    return nCode == kRouterOk ? ReadBack(wanted) : CodeText(nCode);
+}
+
+// Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
+int Pass::AddWithLease(RouterMapping mapping) {
+    mapping.szClient = mSzBox;
+    mapping.nLease = mHabit.blPermanentOnly ? 0 : mHabit.nLease;
+    int nCode = mRouter.Add(mapping);
+    if (mapping.nLease != 0 && (nCode == kRouterOnlyPermanentLeases || nCode == kRouterInvalidArgs)) {
+        const bool blSaysSo = nCode == kRouterOnlyPermanentLeases;
+        mapping.nLease = 0;
+        nCode = mRouter.Add(mapping);
+        mHabit.blPermanentOnly = mHabit.blPermanentOnly || (nCode == kRouterOk || blSaysSo);
+    }
+    return nCode;
+}
+
+// A router's yes is not enough: the mapping must be in its table, and be ours.
+std::string Pass::ReadBack(const RouterMapping& wanted) {
+    RouterMapping entry;
+    const int nCode = Note(mRouter.Get(wanted.szProtocol, wanted.nRouterPort, entry));
+    if (nCode == kRouterNoSuchEntry) {
+        return "lost";
+    }
+    if (nCode != kRouterOk) {
+        return CodeText(nCode);
+    }
+    if (!Serves(entry, wanted)) {
+        return entry.szClient == mSzBox ? "lost" : CodeText(kRouterConflict);
+    }
+    NoteLease(entry.nLease);
+    return "1";
+}
+
+// The listing did not show who is in the way; ask for this port alone.
+std::string Pass::AfterConflict(const RouterMapping& wanted) {
+    RouterMapping entry;
+    if (Note(mRouter.Get(wanted.szProtocol, wanted.nRouterPort, entry)) != kRouterOk) {
+        return CodeText(kRouterConflict);  // a router that guards its entries does not even show them
+    }
+    if (Serves(entry, wanted)) {
+        return "1";
+    }
+    if (!IsOwn(entry) || Note(mRouter.Remove(wanted.szProtocol, wanted.nRouterPort)) != kRouterOk) {
+        return CodeText(kRouterConflict);
+    }
+    const int nCode = Note(AddWithLease(wanted));
+    return nCode == kRouterOk ? ReadBack(wanted) : CodeText(nCode);
+}
+
+}  // namespace
+
+std::string CodeText(int nCode) {
+    switch (nCode) {
+        case kRouterOk:
+            return "stopped";
+        case kRouterTimeout:
+            return "timeout";
+        case kRouterUnreachable:
+            return "unreachable";
+        case kRouterGarbage:
+            return "garbage";
+        default:
+            return std::to_string(nCode);
+    }
+}
+
+PassResult Reconcile(Router& router, const std::vector<RouterMapping>& rgWanted, const std::string& szBox,
+                     LeaseHabit& habit, bool blRenew, const std::function<bool()>& fnStop) {
+    return Pass(router, szBox, habit, blRenew, fnStop).Run(rgWanted);
+}
+
+}  // namespace tavo

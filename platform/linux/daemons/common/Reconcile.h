@@ -1,0 +1,36 @@
+// Brings a router's table in line with the wanted mappings. Relies on a Router and nothing else.
+// Promises: mappings of other hosts and of other programs are never touched; a mapping counts as there
+// only when the router showed it; ends soon after fnStop answers true or the deadline has passed.
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "upnp/Router.h"
+
+namespace tavo {
+
+// What was learnt about one router, kept between passes.
+struct LeaseHabit {
+    uint32_t nLease = 3600;        // seconds to ask for
+    bool blPermanentOnly = false;  // it refuses leases
+};
+
+struct PassResult {
+    std::vector<std::pair<std::string, std::string>> rgStatus;  // mapping name, "1" or the code or word of failure
+    uint32_t nShortestLease = 0;                                // seconds granted; 0: all permanent
+    int nTransport = kRouterOk;                                 // below 0: why the router could not be spoken to
+    bool blStopped = false;
+};
+
+// rgWanted: with client addresses unset; szBox: the box's own address. blRenew: leases are due.
+PassResult Reconcile(Router& router, const std::vector<RouterMapping>& rgWanted, const std::string& szBox,
+                     LeaseHabit& habit, bool blRenew, const std::function<bool()>& fnStop);
+
+// The text of a failure in the status file: the protocol's code, or "timeout", "unreachable", "garbage".
+std::string CodeText(int nCode);
+
+}  // namespace tavo

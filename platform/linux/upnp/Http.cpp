@@ -1,0 +1,137 @@
+// HTTP requests with a deadline and a bounded body. Relies on libcurl, and not on the UPnP client
+// library's own HTTP, which has no overall deadline and reads a body without end.
+// Promises: see Http.h.
+#include "upnp/Http.h"
+
+#include <curl/curl.h>
+
+#include <new>
+
+namespace tavo {
+
+namespace {
+
+constexpr long kConnectMilliseconds = 3000;
+constexpr long kRequestMilliseconds = 5000;
+constexpr size_t kMaxBody = 256U << 10U;
+
+struct ListFree {
+    void operator()(curl_slist* pList) const { curl_slist_free_all(pList); }
+};
+using HeaderList = std::unique_ptr<curl_slist, ListFree>;
+
+// Refusing a byte makes libcurl end the transfer.
+size_t TakeBody(char* pData, size_t nSize, size_t nCount, void* pUser) {
+    auto* pBody = static_cast<std::string*>(pUser);
+    const size_t nBytes = nSize * nCount;
+    if (pBody->size() + nBytes > kMaxBody) {
+        return 0;
+    }
+    pBody->append(pData, nBytes);
+    return nBytes;
+}
+
+HttpEnd EndOf(CURLcode enCode) {
+    switch (enCode) {
+        case CURLE_OK:
+            return HttpEnd::kAnswered;
+        case CURLE_OPERATION_TIMEDOUT:
+            return HttpEnd::kTimeout;
+        case CURLE_COULDNT_CONNECT:
+        case CURLE_SEND_ERROR:
+            return HttpEnd::kUnreachable;
+        default:
+            return HttpEnd::kGarbage;
+    }
+}
+
+struct UrlFree {
+    void operator()(CURLU* pUrl) const { curl_url_cleanup(pUrl); }
+};
+
+std::string UrlPart(CURLU* pUrl, CURLUPart enPart) {
+    char* szPart = nullptr;
+    if (curl_url_get(pUrl, enPart, &szPart, CURLU_DEFAULT_PORT) != CURLUE_OK) {
+        return "";
+    }
+    std::string szText = szPart;
+    curl_free(szPart);
+    return szText;
+}
+
+HeaderList MakeHeaders(const std::vector<std::string>& rgszHeaders) {
+    HeaderList pHeaders;
+    for (const std::string& szHeader : rgszHeaders) {
+        curl_slist* pGrown = curl_slist_append(pHeaders.get(), szHeader.c_str());
+        if (pGrown == nullptr) {
+            throw std::bad_alloc();
+        }
+        static_cast<void>(pHeaders.release());
+        pHeaders.reset(pGrown);
+    }
+    return pHeaders;
+}
+
+}  // namespace
+
+std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl) {
+    const std::unique_ptr<CURLU, UrlFree> pUrl(curl_url());
+    if (!pUrl || curl_url_set(pUrl.get(), CURLUPART_URL, szUrl.c_str(), 0) != CURLUE_OK ||
+        UrlPart(pUrl.get(), CURLUPART_SCHEME) != "http" || !UrlPart(pUrl.get(), CURLUPART_USER).empty()) {
+        return std::nullopt;
+    }
+    const std::string szQuery = UrlPart(pUrl.get(), CURLUPART_QUERY);
+    return HttpUrl{UrlPart(pUrl.get(), CURLUPART_HOST), std::stoi(UrlPart(pUrl.get(), CURLUPART_PORT)),
+                   UrlPart(pUrl.get(), CURLUPART_PATH) + (szQuery.empty() ? "" : "?" + szQuery)};
+}
+
+struct HttpClient::Impl {
+    CURL* pCurl = curl_easy_init();
+    ~Impl() { curl_easy_cleanup(pCurl); }
+};
+
+HttpClient::HttpClient() : mPImpl(std::make_unique<Impl>()) {}
+
+HttpClient::~HttpClient() = default;
+
+HttpAnswer HttpClient::Get(const HttpUrl& url) {
+    return Perform(url, {}, nullptr);
+}
+
+HttpAnswer HttpClient::Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
+                            const std::string& szBody) {
+    return Perform(url, rgszHeaders, &szBody);
+}
+
+HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
+                               const std::string* pSzBody) {
+    HttpAnswer answer;
+    CURL* pCurl = mPImpl->pCurl;
+    if (pCurl == nullptr) {
+        return answer;
+    }
+    curl_easy_reset(pCurl);  // keeps the open connection
+    const HeaderList pHeaders = MakeHeaders(rgszHeaders);
+    const std::string szUrl = url.Text();
+    curl_easy_setopt(pCurl, CURLOPT_URL, szUrl.c_str());
+    curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, "http");
+    curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
+    curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);
+    curl_easy_setopt(pCurl, CURLOPT_TCP_NODELAY, 1L);
+    curl_easy_setopt(pCurl, CURLOPT_CONNECTTIMEOUT_MS, kConnectMilliseconds);
+    curl_easy_setopt(pCurl, CURLOPT_TIMEOUT_MS, kRequestMilliseconds);
+    curl_easy_setopt(pCurl, CURLOPT_USERAGENT, "Linux UPnP/1.1 tavo/1.0");
+    curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
+    curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakeBody);
+    curl_easy_setopt(pCurl, CURLOPT_WRITEDATA, &answer.szBody);
+    if (pSzBody != nullptr) {
+        curl_easy_setopt(pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(pSzBody->size()));
+        curl_easy_setopt(pCurl, CURLOPT_POSTFIELDS, pSzBody->c_str());
+    }
+    answer.enEnd = EndOf(curl_easy_perform(pCurl));
+    curl_easy_getinfo(pCurl, CURLINFO_RESPONSE_CODE, &answer.nCode);
+    return answer;
+}
+
+}  // namespace tavo

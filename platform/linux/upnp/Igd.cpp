@@ -1,0 +1,314 @@
+// SOAP calls to the gateway's port-mapping service. Relies on Http for bounds and on tinyxml2.
+// Written here and not taken from a UPnP client library, because those read answers without a bound
+// and open a connection for every call. Promises: see Igd.h.
+#include "upnp/Igd.h"
+
+#include <arpa/inet.h>
+#include <tinyxml2.h>
+
+#include <charconv>
+#include <chrono>
+#include <cstring>
+#include <set>
+
+#include "core/TextFile.h"
+#include "upnp/Ssdp.h"
+
+namespace tavo {
+
+namespace {
+
+using tinyxml2::XMLDocument;
+using tinyxml2::XMLElement;
+
+constexpr size_t kMaxText = 256;
+constexpr int kMaxDepth = 12;
+constexpr int kMaxEntries = 65536;
+constexpr auto kListLimit = std::chrono::seconds(30);
+constexpr char kEncoding[] = "http://schemas.xmlsoap.org/soap/encoding/";
+constexpr char kEnvelope[] = "http://schemas.xmlsoap.org/soap/envelope/";
+
+// A name without its namespace prefix, which every router spells its own way.
+std::string_view LocalName(const XMLElement& element) {
+    const std::string_view szName = element.Name();
+    return szName.substr(szName.rfind(':') + 1);
+}
+
+// The first element of that name, in document order; null when there is none near the surface.
+const XMLElement* FindElement(const XMLElement* pElement, std::string_view szName, int nDepth = 0) {
+    for (; pElement != nullptr && nDepth < kMaxDepth; pElement = pElement->NextSiblingElement()) {
+        if (LocalName(*pElement) == szName) {
+            return pElement;
+        }
+        if (const XMLElement* pFound = FindElement(pElement->FirstChildElement(), szName, nDepth + 1)) {
+            return pFound;
+        }
+    }
+    return nullptr;
+}
+
+std::string TextOf(const XMLElement* pElement) {
+    const char* szText = pElement == nullptr ? nullptr : pElement->GetText();
+    return szText == nullptr ? "" : PrintableText(Trim(szText), kMaxText);
+}
+
+template <typename Number>
+std::optional<Number> ParseNumber(const std::string& szText) {
+    Number nValue = 0;
+    const auto [pEnd, error] = std::from_chars(szText.data(), szText.data() + szText.size(), nValue);
+    return error == std::errc() && pEnd == szText.data() + szText.size() ? std::optional<Number>(nValue) : std::nullopt;
+}
+
+bool MapsPorts(const std::string& szType) {
+    return szType.starts_with("urn:schemas-upnp-org:service:WANIPConnection:") ||
+           szType.starts_with("urn:schemas-upnp-org:service:WANPPPConnection:");
+}
+
+// The first service below pElement that maps ports.
+const XMLElement* FindService(const XMLElement* pElement, int nDepth = 0) {
+    for (; pElement != nullptr && nDepth < kMaxDepth; pElement = pElement->NextSiblingElement()) {
+        if (LocalName(*pElement) == "service" && MapsPorts(TextOf(pElement->FirstChildElement("serviceType")))) {
+            return pElement;
+        }
+        if (const XMLElement* pFound = FindService(pElement->FirstChildElement(), nDepth + 1)) {
+            return pFound;
+        }
+    }
+    return nullptr;
+}
+
+// The control address, whole or relative to the description; never on another host.
+std::optional<HttpUrl> ResolveControl(const std::string& szControl, const std::string& szBase,
+                                      const HttpUrl& location) {
+    if (szControl.starts_with("http://")) {
+        const auto url = ParseHttpUrl(szControl);
+        return url && url->szHost == location.szHost ? url : std::nullopt;
+    }
+    HttpUrl url = location;
+    if (const auto base = ParseHttpUrl(szBase); base && base->szHost == location.szHost) {
+        url = *base;
+    }
+    if (szControl.empty()) {
+        return std::nullopt;
+    }
+    url.szPath = szControl.starts_with("/") ? szControl : url.szPath.substr(0, url.szPath.rfind('/') + 1) + szControl;
+    return ParseHttpUrl(url.Text());
+}
+
+std::string EscapeXml(const std::string& szText) {
+    std::string szOut;
+    for (const char c : szText) {
+        switch (c) {
+            case '&':
+                szOut += "&amp;";
+                break;
+            case '<':
+                szOut += "&lt;";
+                break;
+            case '>':
+                szOut += "&gt;";
+                break;
+            case '"':
+                szOut += "&quot;";
+                break;
+            default:
+                szOut += c;
+        }
+    }
+    return szOut;
+}
+
+int CodeOf(const HttpAnswer& answer) {
+    switch (answer.enEnd) {
+        case HttpEnd::kAnswered:
+            return SoapCode(answer.nCode, answer.szBody);
+        case HttpEnd::kTimeout:
+            return kRouterTimeout;
+        case HttpEnd::kUnreachable:
+            return kRouterUnreachable;
+        case HttpEnd::kGarbage:
+            break;
+    }
+    return kRouterGarbage;
+}
+
+bool IsAddress(const std::string& szText) {
+    in_addr address = {};
+    return inet_pton(AF_INET, szText.c_str(), &address) == 1;
+}
+
+// What an entry's answer says beyond its key.
+bool ReadEntry(const XMLElement* pRoot, RouterMapping& mapping) {
+    const auto nBoxPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewInternalPort")));
+    mapping.szClient = TextOf(FindElement(pRoot, "NewInternalClient"));
+    if (!nBoxPort || !IsAddress(mapping.szClient)) {
+        return false;
+    }
+    mapping.nBoxPort = *nBoxPort;
+    mapping.szDescription = TextOf(FindElement(pRoot, "NewPortMappingDescription"));
+    mapping.nLease = ParseNumber<uint32_t>(TextOf(FindElement(pRoot, "NewLeaseDuration"))).value_or(0);
+    const std::string szEnabled = TextOf(FindElement(pRoot, "NewEnabled"));
+    mapping.blEnabled = szEnabled != "0" && szEnabled != "false" && szEnabled != "no";
+    return true;
+}
+
+bool ReadKey(const XMLElement* pRoot, RouterMapping& mapping) {
+    const auto nRouterPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewExternalPort")));
+    mapping.szProtocol = TextOf(FindElement(pRoot, "NewProtocol"));
+    mapping.nRouterPort = nRouterPort.value_or(0);
+    return nRouterPort.has_value() && (mapping.szProtocol == "TCP" || mapping.szProtocol == "UDP");
+}
+
+}  // namespace
+
+std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location) {
+    XMLDocument document;
+    if (document.Parse(szXml.data(), szXml.size()) != tinyxml2::XML_SUCCESS) {
+        return std::nullopt;
+    }
+    const XMLElement* pService = FindService(document.RootElement());
+    if (pService == nullptr) {
+        return std::nullopt;
+    }
+    const std::string szBase =
+        TextOf(FindElement(document.RootElement()->FirstChildElement(), "URLBase", kMaxDepth - 1));
+    const auto control = ResolveControl(TextOf(pService->FirstChildElement("controlURL")), szBase, location);
+    if (!control) {
+        return std::nullopt;
+    }
+    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control};
+}
+
+int SoapCode(long nHttpCode, const std::string& szXml) {
+    XMLDocument document;
+    if (document.Parse(szXml.data(), szXml.size()) != tinyxml2::XML_SUCCESS || document.RootElement() == nullptr) {
+        return kRouterGarbage;
+    }
+    if (FindElement(document.RootElement(), "Fault") == nullptr) {
+        return nHttpCode == 200 && FindElement(document.RootElement(), "Body") != nullptr ? kRouterOk : kRouterGarbage;
+    }
+    const auto nCode = ParseNumber<int>(TextOf(FindElement(document.RootElement(), "errorCode")));
+    return nCode && *nCode > 0 ? *nCode : kRouterGarbage;
+}
+
+std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
+                               std::string* pSzLocation) {
+    std::unique_ptr<Igd> pFound;
+    HttpClient http;
+    const auto fnTry = [&](const HttpUrl& location) {
+        const HttpAnswer answer = http.Get(location);
+        if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
+            return false;
+        }
+        auto service = ParseDescription(answer.szBody, location);
+        if (!service) {
+            return false;
+        }
+        pFound.reset(new Igd(std::move(*service)));
+        if (pSzLocation != nullptr) {
+            *pSzLocation = location.Text();
+        }
+        return true;
+    };
+    if (pSzLocation != nullptr && !pSzLocation->empty()) {
+        const auto known = ParseHttpUrl(*pSzLocation);
+        if (known && known->szHost == szGateway && fnTry(*known)) {
+            return pFound;
+        }
+    }
+    SearchGateway(szGateway, szLocal, nLimitMilliseconds, fnTry);
+    return pFound;
+}
+
+int Igd::Call(const char* szAction, const std::vector<Argument>& rgArguments, std::string& szAnswer) {
+    std::string szBody = std::string("<?xml version=\"1.0\"?>\r\n<s:Envelope xmlns:s=\"") + kEnvelope +
+                         "\" s:encodingStyle=\"" + kEncoding + "\"><s:Body><u:" + szAction + " xmlns:u=\"" +
+                         mService.szType + "\">";
+    for (const Argument& argument : rgArguments) {
+        szBody += std::string("<") + argument.szName + ">" + EscapeXml(argument.szValue) + "</" + argument.szName + ">";
+    }
+    szBody += std::string("</u:") + szAction + "></s:Body></s:Envelope>\r\n";
+    HttpAnswer answer = mHttp.Post(mService.control,
+                                   {"Content-Type: text/xml; charset=\"utf-8\"",
+                                    "Expect:", "SOAPAction: \"" + mService.szType + "#" + szAction + "\""},
+                                   szBody);
+    szAnswer = std::move(answer.szBody);
+    answer.szBody = szAnswer;
+    return CodeOf(answer);
+}
+
+int Igd::List(std::vector<RouterMapping>& rgMappings) {
+    const auto end = std::chrono::steady_clock::now() + kListLimit;
+    std::vector<RouterMapping> rgRead;
+    std::set<std::pair<std::string, uint16_t>> setSeen;
+    for (int i = 0; i < kMaxEntries; ++i) {
+        if (std::chrono::steady_clock::now() > end) {
+            return kRouterTimeout;
+        }
+        std::string szAnswer;
+        const int nCode = Call("GetGenericPortMappingEntry", {{"NewPortMappingIndex", std::to_string(i)}}, szAnswer);
+        // The end of the table; some routers say so with the codes for bad arguments or no entry.
+        if (nCode == kRouterNoSuchIndex || nCode == kRouterNoSuchEntry || (nCode == kRouterInvalidArgs && i > 0)) {
+            break;
+        }
+        if (nCode != kRouterOk) {
+            return nCode;
+        }
+        XMLDocument document;
+        RouterMapping mapping;
+        document.Parse(szAnswer.data(), szAnswer.size());
+        if (!ReadKey(document.RootElement(), mapping) || !ReadEntry(document.RootElement(), mapping)) {
+            continue;
+        }
+        if (!setSeen.emplace(mapping.szProtocol, mapping.nRouterPort).second) {
+            break;  // a router that ignores the index would go on for ever
+        }
+        rgRead.push_back(std::move(mapping));
+    }
+    rgMappings = std::move(rgRead);
+    return kRouterOk;
+}
+
+int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) {
+    std::string szAnswer;
+    const int nCode =
+        Call("GetSpecificPortMappingEntry",
+             {{"NewRemoteHost", ""}, {"NewExternalPort", std::to_string(nRouterPort)}, {"NewProtocol", szProtocol}},
+             szAnswer);
+    if (nCode != kRouterOk) {
+        return nCode;
+    }
+    XMLDocument document;
+    document.Parse(szAnswer.data(), szAnswer.size());
+    RouterMapping read;
+    read.szProtocol = szProtocol;
+    read.nRouterPort = nRouterPort;
+    if (!ReadEntry(document.RootElement(), read)) {
+        return kRouterGarbage;
+    }
+    mapping = std::move(read);
+    return kRouterOk;
+}
+
+int Igd::Add(const RouterMapping& mapping) {
+    std::string szAnswer;
+    return Call("AddPortMapping",
+                {{"NewRemoteHost", ""},
+                 {"NewExternalPort", std::to_string(mapping.nRouterPort)},
+                 {"NewProtocol", mapping.szProtocol},
+                 {"NewInternalPort", std::to_string(mapping.nBoxPort)},
+                 {"NewInternalClient", mapping.szClient},
+                 {"NewEnabled", "1"},
+                 {"NewPortMappingDescription", mapping.szDescription},
+                 {"NewLeaseDuration", std::to_string(mapping.nLease)}},
+                szAnswer);
+}
+
+int Igd::Remove(const std::string& szProtocol, uint16_t nRouterPort) {
+    std::string szAnswer;
+    return Call("DeletePortMapping",
+                {{"NewRemoteHost", ""}, {"NewExternalPort", std::to_string(nRouterPort)}, {"NewProtocol", szProtocol}},
+                szAnswer);
+}
+
+}  // namespace tavo

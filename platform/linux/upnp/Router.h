@@ -1,0 +1,44 @@
+// A router's table of port mappings, whatever protocol is spoken to it.
+// Relies on nothing. Promises: every call is bounded in time by its implementation.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace tavo {
+
+struct RouterMapping {
+    std::string szProtocol;  // "TCP" or "UDP"
+    uint16_t nRouterPort = 0;
+    uint16_t nBoxPort = 0;
+    std::string szClient;       // dotted address of the host behind the port
+    std::string szDescription;  // printable, bounded
+    uint32_t nLease = 0;        // seconds; 0: until the router restarts
+    bool blEnabled = true;
+};
+
+// Answers of a router: 0, the protocol's own error code above 0, or why there was no answer below 0.
+enum RouterCode : int {
+    kRouterOk = 0,
+    kRouterTimeout = -1,
+    kRouterUnreachable = -2,
+    kRouterGarbage = -3,
+    kRouterInvalidArgs = 402,
+    kRouterNoSuchIndex = 713,
+    kRouterNoSuchEntry = 714,
+    kRouterConflict = 718,
+    kRouterOnlyPermanentLeases = 725
+};
+
+class Router {
+public:
+    virtual ~Router() = default;
+    // Outputs are set only with kRouterOk.
+    virtual int List(std::vector<RouterMapping>& rgMappings) = 0;
+    virtual int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) = 0;
+    virtual int Add(const RouterMapping& mapping) = 0;
+    virtual int Remove(const std::string& szProtocol, uint16_t nRouterPort) = 0;
+};
+
+}  // namespace tavo

@@ -1,0 +1,23 @@
+// Asks a gateway where its device description is. Relies on UDP sockets.
+// Promises: only an answer from the gateway itself that names the gateway itself counts; ends within
+// the limit; the reason of a refusal is logged.
+#pragma once
+
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "upnp/Http.h"
+
+namespace tavo {
+
+// The LOCATION of one SSDP answer, when it is http on szGateway; otherwise nothing, and szReason says why.
+std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& szGateway, std::string& szReason);
+
+// Asks by unicast and by multicast at once, and hands every new location to fnTry until it answers
+// true. False when none did within nLimitMilliseconds.
+bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
+                   const std::function<bool(const HttpUrl&)>& fnTry);
+
+}  // namespace tavo

@@ -1,0 +1,99 @@
+// tavo-igd: looks at a router's UPnP table by hand and times what upnpd does.
+// Relies on the same classes as upnpd. Promises: maps and unmaps only what carries our own mark.
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "daemons/common/Reconcile.h"
+#include "daemons/common/Wanted.h"
+#include "tavo/net.h"
+#include "upnp/Igd.h"
+
+namespace {
+
+constexpr int kDiscoveryMilliseconds = 5000;
+constexpr int kFirstPort = 20000;
+constexpr int kMostPorts = 1000;
+constexpr char kHelp[] =
+    "Usage: tavo-igd discover | list | map N | unmap\n"
+    "  discover  where the gateway's port-mapping service is\n"
+    "  list      the router's table\n"
+    "  map N     make the tool's mappings TCP 20000 and up, N of them (1 to 1000), the only ones with our mark\n"
+    "  unmap     take every mapping with our mark away\n";
+
+using Clock = std::chrono::steady_clock;
+
+void PrintTime(const char* szWhat, Clock::time_point start) {
+    std::printf("%s_ms=%.2f\n", szWhat, std::chrono::duration<double, std::milli>(Clock::now() - start).count());
+}
+
+int List(tavo::Igd& igd) {
+    std::vector<tavo::RouterMapping> rgMappings;
+    const int nCode = igd.List(rgMappings);
+    if (nCode != tavo::kRouterOk) {
+        std::fprintf(stderr, "tavo-igd: the router answered %s\n", tavo::CodeText(nCode).c_str());
+        return 1;
+    }
+    for (const tavo::RouterMapping& mapping : rgMappings) {
+        std::printf("%-10s -> %s:%u lease %u '%s'\n", tavo::MappingName(mapping).c_str(), mapping.szClient.c_str(),
+                    mapping.nBoxPort, mapping.nLease, mapping.szDescription.c_str());
+    }
+    return 0;
+}
+
+int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
+    std::vector<tavo::RouterMapping> rgWanted;
+    for (int i = 0; i < nPorts; ++i) {
+        const auto nPort = static_cast<uint16_t>(kFirstPort + i);
+        rgWanted.push_back({"TCP", nPort, nPort, "", std::string(tavo::kOwnPrefix) + "igd", 0, true});
+    }
+    tavo::LeaseHabit habit;
+    const tavo::PassResult result = tavo::Reconcile(igd, rgWanted, szBox, habit, false, [] { return false; });
+    int nMissing = 0;
+    for (const auto& [szName, szStatus] : result.rgStatus) {
+        if (szStatus != "1") {
+            std::printf("%s: %s\n", szName.c_str(), szStatus.c_str());
+            ++nMissing;
+        }
+    }
+    return nMissing == 0 && result.nTransport == tavo::kRouterOk ? 0 : 1;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const std::string szVerb = argc > 1 ? argv[1] : "";
+    const int nPorts = szVerb == "map" && argc == 3 ? std::atoi(argv[2]) : 0;
+    const bool blPlain = argc == 2 && (szVerb == "discover" || szVerb == "list" || szVerb == "unmap");
+    if (!blPlain && (nPorts < 1 || nPorts > kMostPorts)) {
+        std::fputs(kHelp, szVerb == "--help" ? stdout : stderr);
+        return szVerb == "--help" ? 0 : 2;
+    }
+    char szGateway[16] = {};
+    char szBox[16] = {};
+    if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0 ||
+        TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) != 0) {
+        std::fputs("tavo-igd: this box has no default gateway\n", stderr);
+        return 1;
+    }
+    const Clock::time_point start = Clock::now();
+    const auto pIgd = tavo::Igd::Find(szGateway, szBox, kDiscoveryMilliseconds, nullptr);
+    if (pIgd == nullptr) {
+        std::fprintf(stderr, "tavo-igd: the gateway %s offers no UPnP port mapping\n", szGateway);
+        return 1;
+    }
+    PrintTime("discover", start);
+    const Clock::time_point work = Clock::now();
+    int nStatus = 0;
+    if (szVerb == "discover") {
+        std::printf("%s at %s\n", pIgd->Service().szType.c_str(), pIgd->Service().control.Text().c_str());
+    } else if (szVerb == "list") {
+        nStatus = List(*pIgd);
+    } else {
+        nStatus = Map(*pIgd, szBox, nPorts);
+    }
+    PrintTime(szVerb.c_str(), work);
+    PrintTime("total", start);
+    return nStatus;
+}

@@ -1,0 +1,203 @@
+"""A home network on one machine: box, lan2 and wan as namespaces, a router between them.
+
+Runs inside tests/sandbox, so that no root is needed and all paths and processes are the test's own.
+The router is Debian's miniupnpd on nftables; scripted_router.py takes its place where a test wants a
+router with faults. Every wait polls to a deadline; every process started here is ended by its pid.
+"""
+import json
+import os
+import re
+import shutil
+import signal
+import subprocess
+import sys
+import time
+
+BUILD = os.environ["TAVO_BUILD_DIR"]
+HERE = os.path.dirname(os.path.abspath(__file__))
+GATEWAY, BOX, LAN2 = "192.168.77.1", "192.168.77.2", "192.168.77.3"
+ROUTER_WAN, WAN = "203.0.113.2", "203.0.113.9"
+PUBLIC = "198.41.0.4"  # what the daemon says its outside address is; it refuses reserved ones
+STATUS = "/var/tmp/upnp_portmap.status"
+
+NFT = f"""
+table inet home {{
+  chain prerouting {{ type nat hook prerouting priority dstnat; jump prerouting_miniupnpd }}
+  chain postrouting {{ type nat hook postrouting priority srcnat; jump postrouting_miniupnpd
+                       oifname "wan0" masquerade }}
+  chain forward {{ type filter hook forward priority filter; policy drop;
+                   ct state established,related accept
+                   iifname "br0" accept
+                   jump miniupnpd }}
+  chain miniupnpd {{ }}
+  chain prerouting_miniupnpd {{ }}
+  chain postrouting_miniupnpd {{ }}
+}}
+"""
+
+
+def sh(command, check=True, **kwargs):
+    return subprocess.run(command, shell=True, check=check, text=True, capture_output=True, **kwargs)
+
+
+def wait_for(condition, seconds, what):
+    end = time.monotonic() + seconds
+    while True:
+        value = condition()
+        if value:
+            return value
+        if time.monotonic() > end:
+            raise AssertionError(f"not within {seconds} s: {what}")
+        time.sleep(0.05)
+
+
+class Lab:
+    def __init__(self):
+        self.processes = []
+        self.router = None
+        for name in ("box", "lan2", "router", "wan"):
+            sh(f"ip netns add {name} && ip -n {name} link set lo up")
+        sh("ip -n router link add br0 type bridge && ip -n router link set br0 up")
+        for name, address in (("box", BOX), ("lan2", LAN2)):
+            sh(f"ip link add {name}0 netns {name} type veth peer name {name}1 netns router && "
+               f"ip -n router link set {name}1 master br0 up && "
+               f"ip -n {name} addr add {address}/24 dev {name}0 && ip -n {name} link set {name}0 up && "
+               f"ip -n {name} route add default via {GATEWAY}")
+        sh(f"ip link add wan0 netns router type veth peer name out0 netns wan && "
+           f"ip -n router addr add {GATEWAY}/24 dev br0 && ip -n router addr add {ROUTER_WAN}/24 dev wan0 && "
+           f"ip -n router link set wan0 up && ip -n wan addr add {WAN}/24 dev out0 && ip -n wan link set out0 up")
+        self.run("router", "sysctl -qw net.ipv4.ip_forward=1")
+        self.run("router", "nft -f -", input=NFT)
+        self.install()
+
+    # ---- the box's files ------------------------------------------------------------------------
+
+    def install(self):
+        for directory in ("/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/sbin",
+                          "/usr/tavo/bin", "/etc/tavo"):
+            os.makedirs(directory, exist_ok=True)
+        for source, target in (("platform/linux/daemons/upnpd", "/usr/tavo/sbin/upnpd"), ):
+            if os.path.lexists(target):
+                os.unlink(target)
+            os.symlink(f"{BUILD}/{source}", target)
+        self.settings()
+        self.write("/etc/portforward/router.conf",
+                   f'[{GATEWAY}]\nbrand="Lab"\nmodel="One"\nversion="1"\n'
+                   'support_router_upnp="yes"\nsupport_router_natpmp="no"\n')
+        self.write("/etc/portforward/router_upnp.db", '[Lab/One/1]\nsupport="yes"\nmax="100"\n')
+
+    def settings(self, check_interval=120, lease=3600):
+        self.write("/etc/tavo/platform.conf",
+                   f'[upnpd]\ncheck_interval="{check_interval}"\nlease="{lease}"\n')
+
+    @staticmethod
+    def write(path, text):
+        with open(path, "w", encoding="utf-8") as file:
+            file.write(text)
+
+    # ---- processes --------------------------------------------------------------------------------
+
+    def run(self, host, command, check=True, **kwargs):
+        return sh(f"ip netns exec {host} {command}", check=check, **kwargs)
+
+    def start(self, host, *command, **kwargs):
+        process = subprocess.Popen(["ip", "netns", "exec", host, *command], stdin=subprocess.DEVNULL, **kwargs)
+        self.processes.append(process)
+        return process
+
+    @staticmethod
+    def end(process):
+        if process.poll() is None:
+            process.kill()
+        process.wait()
+
+    def daemon_pid(self):
+        try:
+            with open("/var/run/upnpd.pid", encoding="ascii") as file:
+                pid = int(file.read())
+            os.kill(pid, 0)
+            return pid
+        except (OSError, ValueError):
+            return 0
+
+    def stop_daemon(self, how=signal.SIGTERM):
+        pid = self.daemon_pid()
+        if pid:
+            os.kill(pid, how)
+            wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 15, "the daemon has ended")
+
+    def close(self):
+        self.stop_daemon(signal.SIGKILL)
+        for process in self.processes:
+            self.end(process)
+
+    # ---- the real router ----------------------------------------------------------------------------
+
+    def start_router(self, version1=False, port=5000):
+        self.write("/tmp/miniupnpd.conf", "\n".join((
+            "ext_ifname=wan0", f"ext_ip={PUBLIC}", "listening_ip=br0", f"http_port={port}", "enable_natpmp=yes",
+            "enable_upnp=yes", "secure_mode=yes", "upnp_table_name=home", "upnp_nat_table_name=home",
+            "upnp_forward_chain=miniupnpd", "upnp_nat_chain=prerouting_miniupnpd",
+            "upnp_nat_postrouting_chain=postrouting_miniupnpd", "uuid=00000000-0000-0000-0000-000000000001",
+            "force_igd_desc_v1=" + ("yes" if version1 else "no"), "allow 1-65535 192.168.77.0/24 1-65535",
+            "deny 0-65535 0.0.0.0/0 0-65535", "")))
+        self.router = self.start("router", "/usr/sbin/miniupnpd", "-d", "-f", "/tmp/miniupnpd.conf",
+                                 stdout=subprocess.DEVNULL, stderr=open("/tmp/miniupnpd.log", "w"))
+        wait_for(lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
+                                  check=False).returncode == 0, 10, "the router is up")
+
+    def stop_router(self):
+        """Without a word to anybody, as when the power goes."""
+        self.end(self.router)
+        for chain in ("miniupnpd", "prerouting_miniupnpd", "postrouting_miniupnpd"):
+            self.run("router", f"nft flush chain inet home {chain}")
+
+    def reboot_router(self, **kwargs):
+        self.stop_router()
+        self.start_router(**kwargs)
+
+    def mappings(self):
+        """What the router really does, from its packet filter: {(protocol, port): (host, port)}."""
+        rules = self.run("router", "nft list chain inet home prerouting_miniupnpd").stdout
+        return {(m[1], int(m[2])): (m[3], int(m[4])) for m in re.finditer(
+            r"(tcp|udp) dport (\d+) .*?dnat ip to ([\d.]+):(\d+)", rules)}
+
+    def map_foreign(self, port, protocol="TCP"):
+        self.run("lan2", f"upnpc -a {LAN2} {port} {port} {protocol}")
+
+    # ---- connections ----------------------------------------------------------------------------------
+
+    def serve(self, *ports):
+        """An echo on the box for TCP and UDP."""
+        self.start("box", "/usr/bin/python3", f"{HERE}/echo.py", "serve", *map(str, ports))
+        wait_for(lambda: all(self.run("box", f"/usr/bin/python3 {HERE}/echo.py tcp 127.0.0.1 {p}",
+                                      check=False).returncode == 0 for p in ports), 10, "the echo is up")
+
+    def reaches(self, protocol, port):
+        """Whether a stranger outside gets an answer through the router."""
+        return self.run("wan", f"/usr/bin/python3 {HERE}/echo.py {protocol} {ROUTER_WAN} {port}",
+                        check=False).returncode == 0
+
+    # ---- saving ---------------------------------------------------------------------------------------
+
+    def start_save(self, *rules):
+        """Rules are "id,enabled,protocol,router port,box port" with ";" between several ports."""
+        return self.start("box", f"{BUILD}/tests/lab/saver", GATEWAY, *rules,
+                          stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
+
+    def save(self, *rules, seconds=60):
+        out, _ = self.start_save(*rules).communicate(timeout=seconds)
+        return json.loads(out)
+
+    @staticmethod
+    def status():
+        with open(STATUS, encoding="utf-8") as file:
+            return dict(line.rstrip("\n").split("=", 1) for line in file)
+
+
+def in_lab(main):
+    lab = Lab()
+    try:
+        return main(lab)
+    finally:
+        lab.close()

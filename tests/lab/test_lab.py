@@ -1,0 +1,159 @@
+"""Rules saved on the box, a real router, and a stranger outside who tries to connect."""
+import fcntl
+import os
+import signal
+import sys
+import unittest
+
+import homelab
+from homelab import BOX, GATEWAY, LAN2, wait_for
+
+LAB = None
+
+
+def only_box(mappings):
+    return {key: port for key, (host, port) in mappings.items() if host == BOX}
+
+
+class RealRouter(unittest.TestCase):
+    flavours = (False, True)
+
+    def setUp(self):
+        LAB.install()
+        LAB.start_router()
+
+    def tearDown(self):
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.stop_router()
+        for path in ("/etc/portforward/rule.conf", "/tmp/pfProgress", "/var/lib/tavo/upnp_igd.conf"):
+            if os.path.exists(path):
+                os.unlink(path)
+
+    def test_three_saves_in_a_row(self):
+        steps = (
+            (("1,1,tcp,5001,5001", "2,1,udp,6001,5002", "3,1,all,7001-7002,5003-5004", "4,0,tcp,8001,5001"),
+             {("tcp", 5001): 5001, ("udp", 6001): 5002, ("tcp", 7001): 5003, ("udp", 7001): 5003,
+              ("tcp", 7002): 5004, ("udp", 7002): 5004}),
+            (("1,1,tcp,5001,5002", "2,1,tcp,6001;6003,5003-5004"),
+             {("tcp", 5001): 5002, ("tcp", 6001): 5003, ("tcp", 6003): 5004}),
+            ((), {}))
+        probes = [(protocol, port) for protocol in ("tcp", "udp") for port in (5001, 6001, 7001, 7002, 6003, 8001)]
+        for version1 in self.flavours:
+            LAB.reboot_router(version1=version1)
+            LAB.map_foreign(9999)
+            for rules, wanted in steps:
+                with self.subTest(version1=version1, rules=rules):
+                    answer = LAB.save(*rules)
+                    self.assertEqual((answer["result"], answer["status"]), (0, 0))
+                    self.assertEqual(answer["progress"],
+                                     [20, 40, 60, 80, 90, 100] if rules else [20, 40, 60, 80, 100])
+                    wait_for(lambda: only_box(LAB.mappings()) == wanted, 10, f"{wanted}, not {LAB.mappings()}")
+                    self.assertEqual(LAB.mappings()[("tcp", 9999)], (LAN2, 9999))
+                    self.assertEqual([probe for probe in probes if LAB.reaches(*probe)],
+                                     [probe for probe in probes if probe in wanted])
+            LAB.stop_daemon(signal.SIGKILL)
+
+    def test_a_port_that_another_host_holds(self):
+        LAB.map_foreign(5001)
+        answer = LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")
+        self.assertEqual((answer["result"], answer["status"], answer["ports"]), (-1, 8, "5001/tcp"))
+        self.assertEqual(LAB.mappings(), {("tcp", 5001): (LAN2, 5001), ("tcp", 5002): (BOX, 5002)})
+        with open("/var/log/tavo/event.log", encoding="utf-8") as log:
+            self.assertIn("0x13100022 The router already uses these ports for something else: 5001/tcp", log.read())
+
+    def test_rules_that_cannot_be_paired_are_reported_and_the_others_mapped(self):
+        answer = LAB.save("1,1,tcp,5001-5003,5001-5002", "2,1,tcp,5004,5004", "3,1,tcp,99999,1")
+        self.assertEqual((answer["status"], answer["ports"]), (9, "5001-5003/tcp, 99999/tcp"))
+        self.assertEqual(LAB.mappings(), {("tcp", 5004): (BOX, 5004)})
+
+    def test_more_rules_than_the_database_allows(self):
+        LAB.write("/etc/portforward/router_upnp.db", '[Lab/One/1]\nmax="2"\n')
+        LAB.save("1,1,tcp,5001,5001")
+        before = open("/etc/portforward/rule.conf", encoding="utf-8").read()
+        answer = LAB.save(*(f"{i},1,tcp,{5000 + i},{5000 + i}" for i in range(1, 4)))
+        self.assertEqual((answer["result"], answer["status"], answer["limit"]), (-1, 7, 2))
+        self.assertEqual(open("/etc/portforward/rule.conf", encoding="utf-8").read(), before)
+
+    def test_stop_takes_the_mappings_away(self):
+        LAB.map_foreign(9999)
+        LAB.save("1,1,tcp,5001,5001")
+        LAB.stop_daemon(signal.SIGTERM)
+        self.assertEqual(LAB.mappings(), {("tcp", 9999): (LAN2, 9999)})
+        self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
+
+    def test_killed_daemon_and_rebooted_router(self):
+        LAB.settings(check_interval=1)
+        LAB.save("1,1,tcp,5001,5001")
+        LAB.stop_daemon(signal.SIGKILL)
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+        wanted = {("tcp", 5001): (BOX, 5001)}
+        self.assertEqual(LAB.mappings(), wanted)
+        LAB.reboot_router(port=5555)
+        self.assertEqual(LAB.mappings(), {})
+        wait_for(lambda: LAB.mappings() == wanted, 30, "the mapping is back after the reboot")
+
+    def test_saver_killed_in_mid_save_leaves_whole_rules(self):
+        LAB.save("1,1,tcp,5001,5001")
+        for polls in range(0, 60, 6):
+            saver = LAB.start_save(*(f"{i},1,tcp,{5000 + i},{5000 + i}" for i in range(1, 20)))
+            end = polls
+            while end and saver.poll() is None:
+                end -= 1
+                wait_for(lambda: True, 1, "a moment")
+                os.sched_yield()
+            LAB.end(saver)
+            text = open("/etc/portforward/rule.conf", encoding="utf-8").read()
+            self.assertIn(text.count("["), (1, 19), text)
+            self.assertEqual(text.count("service="), text.count("["))
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+        self.assertEqual(LAB.mappings(), {("tcp", 5001): (BOX, 5001)})
+
+    def test_two_savers_and_the_lock_afterwards(self):
+        LAB.stop_router()  # the first save has to look for the router for a while
+        first = LAB.start_save("1,1,tcp,5001,5001")
+        def is_locked():
+            with open("/tmp/routerconf.lock", "a", encoding="ascii") as file:
+                try:
+                    fcntl.flock(file, fcntl.LOCK_EX | fcntl.LOCK_NB)
+                    return False
+                except OSError:
+                    return True
+        wait_for(is_locked, 5, "the first saver holds the lock")
+        answer = LAB.save("2,1,tcp,5002,5002", seconds=2)
+        self.assertEqual((answer["result"], answer["status"], answer["progress"]), (-1, 2, [20]))
+        first.communicate(timeout=60)
+        self.assertTrue(LAB.daemon_pid())
+        self.assertFalse(is_locked())
+        LAB.start_router()
+
+
+class NoRouter(unittest.TestCase):
+    def tearDown(self):
+        LAB.stop_daemon(signal.SIGKILL)
+
+    def test_gateway_without_upnp(self):
+        LAB.install()
+        answer = LAB.save("1,1,tcp,5001,5001", seconds=60)
+        self.assertEqual((answer["result"], answer["status"], answer["ports"]), (-1, 9, "5001/tcp"))
+        self.assertEqual(LAB.status(), {"5001/tcp": "noigd"})
+        self.assertIn('r_port="5001"', open("/etc/portforward/rule.conf", encoding="utf-8").read())
+
+    def test_unreadable_rule_and_router_files_are_kept(self):
+        LAB.write("/etc/portforward/router.conf", "this is no router file\n")
+        answer = LAB.save("1,1,tcp,5001,5001")
+        self.assertEqual((answer["result"], answer["status"], answer["progress"]), (-1, 0, [20, 40]))
+        self.assertEqual(open("/etc/portforward/router.conf", encoding="utf-8").read(), "this is no router file\n")
+
+
+def main(lab):
+    global LAB
+    LAB = lab
+    lab.serve(5001, 5002, 5003, 5004)
+    result = unittest.main(exit=False, verbosity=2).result
+    failed = len(result.failures) + len(result.errors)
+    print(f"{result.testsRun - failed} passed, {failed} failed")
+    return 1 if failed or not result.testsRun else 0
+
+
+if __name__ == "__main__":
+    sys.exit(homelab.in_lab(main))
