@@ -7,10 +7,8 @@ router with faults. Every wait polls to a deadline; every process started here i
 import json
 import os
 import re
-import shutil
 import signal
 import subprocess
-import sys
 import time
 
 BUILD = os.environ["TAVO_BUILD_DIR"]
@@ -20,19 +18,27 @@ ROUTER_WAN, WAN = "203.0.113.2", "203.0.113.9"
 PUBLIC = "198.41.0.4"  # what the daemon says its outside address is; it refuses reserved ones
 STATUS = "/var/tmp/upnp_portmap.status"
 
-NFT = f"""
-table inet home {{
-  chain prerouting {{ type nat hook prerouting priority dstnat; jump prerouting_miniupnpd }}
-  chain postrouting {{ type nat hook postrouting priority srcnat; jump postrouting_miniupnpd
-                       oifname "wan0" masquerade }}
-  chain forward {{ type filter hook forward priority filter; policy drop;
-                   ct state established,related accept
-                   iifname "br0" accept
-                   jump miniupnpd }}
-  chain miniupnpd {{ }}
-  chain prerouting_miniupnpd {{ }}
-  chain postrouting_miniupnpd {{ }}
-}}
+NFT = """
+table inet home {
+  chain miniupnpd { }
+  chain prerouting_miniupnpd { }
+  chain postrouting_miniupnpd { }
+  chain prerouting {
+    type nat hook prerouting priority dstnat
+    jump prerouting_miniupnpd
+  }
+  chain postrouting {
+    type nat hook postrouting priority srcnat
+    jump postrouting_miniupnpd
+    oifname "wan0" masquerade
+  }
+  chain forward {
+    type filter hook forward priority filter; policy drop
+    ct state established,related accept
+    iifname "br0" accept
+    jump miniupnpd
+  }
+}
 """
 
 
@@ -142,7 +148,7 @@ class Lab:
             "force_igd_desc_v1=" + ("yes" if version1 else "no"), "allow 1-65535 192.168.77.0/24 1-65535",
             "deny 0-65535 0.0.0.0/0 0-65535", "")))
         self.router = self.start("router", "/usr/sbin/miniupnpd", "-d", "-f", "/tmp/miniupnpd.conf",
-                                 stdout=subprocess.DEVNULL, stderr=open("/tmp/miniupnpd.log", "w"))
+                                 stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
         wait_for(lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
                                   check=False).returncode == 0, 10, "the router is up")
 
@@ -159,8 +165,9 @@ class Lab:
     def mappings(self):
         """What the router really does, from its packet filter: {(protocol, port): (host, port)}."""
         rules = self.run("router", "nft list chain inet home prerouting_miniupnpd").stdout
-        return {(m[1], int(m[2])): (m[3], int(m[4])) for m in re.finditer(
-            r"(tcp|udp) dport (\d+) .*?dnat ip to ([\d.]+):(\d+)", rules)}
+        number = {"0x6": "tcp", "0x11": "udp"}
+        return {(number.get(m[1], m[1]), int(m[2])): (m[3], int(m[4])) for m in re.finditer(
+            r"(0x6|0x11|tcp|udp) (?:th )?dport (\d+) .*?dnat ip to ([\d.]+):(\d+)", rules)}
 
     def map_foreign(self, port, protocol="TCP"):
         self.run("lan2", f"upnpc -a {LAN2} {port} {port} {protocol}")
@@ -188,6 +195,11 @@ class Lab:
     def save(self, *rules, seconds=60):
         out, _ = self.start_save(*rules).communicate(timeout=seconds)
         return json.loads(out)
+
+    @staticmethod
+    def read(path):
+        with open(path, encoding="utf-8") as file:
+            return file.read()
 
     @staticmethod
     def status():

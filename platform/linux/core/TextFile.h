@@ -37,7 +37,7 @@ TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_vi
                                        mode_t nNewMode = kPrivateMode);
 
 // All sections in file order. Nothing when any line is neither section, pair, comment nor blank.
-std::optional<std::vector<Section>> ParseSections(std::string_view szText);
+TAVO_PLATFORM_API std::optional<std::vector<Section>> ParseSections(std::string_view szText);
 std::string FormatSections(const std::vector<Section>& rgSections);
 
 // One line of a key file as key and value; nothing for blank lines, comments and what is neither.

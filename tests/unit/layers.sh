@@ -1,0 +1,15 @@
+#!/bin/bash
+# Who may include whom. Fails also when a folder named here is gone, so that the rule cannot rot.
+set -eu
+cd "$1"
+forbid() { # FOLDER PATTERN REASON
+    [ -d "$1" ] || { echo "no folder $1"; exit 1; }
+    if grep -rnE "#include [<\"]$2" "$1"; then
+        echo "$1: $3"
+        exit 1
+    fi
+}
+forbid src '(core|portforward|net|upnp|daemons)/' "the library knows the platform by its seam only"
+forbid platform 'libtavoportmap' "the platform stands beneath the library"
+forbid cli '(tavo|core|portforward|upnp|daemons)/' "callers use the public header only"
+forbid include 'tavo/' "the public header stands alone"

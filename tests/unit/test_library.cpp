@@ -1,0 +1,275 @@
+// The library over the real platform: stores, knowledge base, locks and the saving of rules.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+
+#include <cstring>
+
+#include "libtavoportmap.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
+#include "world.h"
+
+namespace {
+
+constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+using Rule = __tag_TAVO_ROUTER_RULE;
+using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
+
+class Library : public testing::Test {
+protected:
+    void SetUp() override {
+        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"}) {
+            std::filesystem::remove_all(szDir);
+            std::filesystem::create_directories(szDir);
+        }
+        std::filesystem::remove("/etc/tavoinfo.conf");
+        gLog.clear();
+        gSzGateway = "192.168.1.1";
+        gNSlept = 0;
+    }
+    static Rule MakeRule(const char* szId, const char* szPorts) {
+        Rule rule = {};
+        rule.blEnable = true;
+        snprintf(rule.szRuleID, sizeof(rule.szRuleID), "%s", szId);
+        snprintf(rule.szProtocol, sizeof(rule.szProtocol), "tcp");
+        snprintf(rule.szRouterPort, sizeof(rule.szRouterPort), "%s", szPorts);
+        snprintf(rule.szSrcPort, sizeof(rule.szSrcPort), "%s", szPorts);
+        return rule;
+    }
+    // A router driven by a script, and a script that takes note of having run.
+    static void MakeManual(const std::string& szPages) {
+        Write(kRouterConf,
+              "[192.168.1.1]\nbrand=B\nmodel=M\nversion=1\nsupport_router_upnp=no\n"
+              "support_router_natpmp=no\n");
+        Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", szPages);
+        Write(kTool, "#!/bin/sh\ntouch /tmp/ran\n");
+        chmod(kTool, 0755);
+        std::filesystem::remove("/tmp/ran");
+    }
+};
+
+TEST_F(Library, SupportWords) {
+    char szOut[8] = "kept";
+    EXPECT_EQ(TLibSupportEnumToString(szOut, 8, static_cast<__tag_TAVO_ROUTER_SUPPORT>(3)), 0);
+    EXPECT_STREQ(szOut, "kept");
+    EXPECT_TRUE(Logged("non-support enum case"));
+    EXPECT_EQ(TLibSupportStringToEnum(nullptr, nullptr), -1);
+    EXPECT_TRUE(Logged("szSupport is NULL"));
+    auto enSupport = TAVO_ROUTER_SUPPORT_YES;
+    EXPECT_EQ(TLibSupportStringToEnum(&enSupport, "Yes"), -1);
+    EXPECT_TRUE(Logged("non-support szSupport=Yes"));
+    EXPECT_EQ(TLibSupportStringToEnum(&enSupport, "unknown"), 0);
+    EXPECT_EQ(enSupport, TAVO_ROUTER_SUPPORT_UNKNOWN);
+}
+
+TEST_F(Library, RuleArrays) {
+    int nRules = 7;
+    Rule* pRules = nullptr;
+    auto enErr = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
+    EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, true, &enErr), 0);
+    EXPECT_EQ(nRules, 0);
+    EXPECT_EQ(enErr, 0);
+    Write(kRuleConf,
+          "[1]\nenabled=1\ns_port=1\nr_port=2\nprotocol name=tcp\nservice=web\nservice_id=W\n"
+          "[2]\nenabled=yes\ns_port=3\nr_port=4\nprotocol name=udp\n");
+    ASSERT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, true, nullptr), 0);
+    ASSERT_EQ(nRules, 2);
+    EXPECT_TRUE(pRules[0].blEnable);
+    EXPECT_FALSE(pRules[1].blEnable);
+    EXPECT_STREQ(pRules[1].szServiceName, "web");  // carried over
+    EXPECT_STREQ(pRules[1].szServiceID, "");
+    EXPECT_STREQ(pRules[1].szRouterPort, "4");
+    EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr), -1);
+    EXPECT_TRUE(Logged("pRgRules is NULL or *pRgRules is not NULL"));
+    TLibFreeRulesArr(pRules);
+    pRules = nullptr;
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, true, &enErr), -1);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_CONFLICT);
+    EXPECT_TRUE(Logged("PortForward conflict = /tmp/routerconf.lock"));
+    TLibTavoPortMapUnLock();
+    Write(kRuleConf, "[1]\nenabled=1\ns_port=1\nprotocol name=tcp\n");
+    EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, true, nullptr), -1);
+    EXPECT_EQ(pRules, nullptr);
+    EXPECT_TRUE(Logged("get rule router port failed"));
+}
+
+TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
+    Write(kRuleConf, "[9]\nenabled=1\n");
+    for (const char* szFailing : {"whole write", "first rename"}) {
+        RouterRuleConfWriter writer;
+        ASSERT_EQ(writer.AddRule(7, true, "1", "2", "tcp", "", "web"), 1);
+        if (std::strcmp(szFailing, "first rename") == 0) {
+            gSzFailRename = kRuleConf;
+        } else {
+            // The new file's own last step fails: it is refused where it would take its name.
+            mkdir("/etc/portforward/dir", 0755);
+            EXPECT_EQ(writer.Sync("/etc/portforward/dir"), 0);
+            std::filesystem::remove("/etc/portforward/dir");
+            continue;
+        }
+        EXPECT_EQ(writer.Sync(), 0) << szFailing;
+        EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
+        EXPECT_EQ(std::distance(std::filesystem::directory_iterator("/etc/portforward"), {}), 1);
+        EXPECT_EQ(writer.Sync(), 1);
+        EXPECT_NE(Read(kRuleConf).find("[7]\nenabled=\"1\"\ns_port=\"2\"\nr_port=\"1\"\n"), std::string::npos);
+    }
+}
+
+TEST_F(Library, RouterConfWriterKeepsOrDropsOtherGateways) {
+    const std::string szBoth = "[10.0.0.1]\nbrand=\"old\"\n\n[192.168.1.1]\nbrand=\"mine\"\nuser=\"u\"\n";
+    Write(kRouterConf, szBoth);
+    {
+        RouterConfWriter writer(true);
+        EXPECT_EQ(writer.SetSupportUpnp("unknown"), 1);
+        EXPECT_EQ(writer.SetSupportNatpmp("unknown"), 1);
+        EXPECT_EQ(writer.SetUserPass("", "p"), 1);
+        EXPECT_EQ(writer.Sync(), 1);
+    }
+    EXPECT_NE(Read(kRouterConf).find("[10.0.0.1]"), std::string::npos);
+    EXPECT_NE(Read(kRouterConf).find("router_type=\"upnp\""), std::string::npos);
+    EXPECT_EQ(Read(kRouterConf).find("use_custom_account"), std::string::npos);
+    {
+        RouterConfWriter writer(false);
+        EXPECT_EQ(writer.SetBrandModelVersion("x\"\n[evil]\nk=\"v", "m", "1"), 1);
+        EXPECT_EQ(writer.Sync(), 1);
+    }
+    RouterConfReader reader("192.168.1.1");
+    std::string szBrand;
+    EXPECT_EQ(reader.GetBrand(szBrand), 1);
+    EXPECT_EQ(szBrand, "x\"\n[evil]\nk=\"v");
+    bool blExist = true;
+    EXPECT_EQ(RouterConfReader("10.0.0.1").IsSectionExist(blExist), 1);
+    EXPECT_FALSE(blExist);
+    EXPECT_TRUE(Logged("User router changed new gatway ip = 10.0.0.1"));
+    gSzGateway = "0.0.0.0";
+    EXPECT_EQ(RouterConfWriter(false).SetUser("u"), 0);
+    EXPECT_TRUE(Logged("error gateway router ip: 0.0.0.0"));
+    EXPECT_TRUE(Logged("init failed"));
+}
+
+TEST_F(Library, RouterNames) {
+    std::string szBrand, szModel, szVersion;
+    char szName[] = "N: W (1.0(2))";
+    EXPECT_TRUE(SplitRouterName(szName, szBrand, szModel, szVersion));
+    EXPECT_EQ(szBrand + "|" + szModel + "|" + szVersion, "N|W |1.0(2)");
+    char szGeneric[] = "N: G";
+    EXPECT_FALSE(SplitRouterName(szGeneric, szBrand, szModel, szVersion));
+    Write("/etc.defaults/portforward/routerdb/N/G/generic", "version=\"5\"\n");
+    EXPECT_TRUE(SplitRouterName(szGeneric, szBrand, szModel, szVersion));
+    EXPECT_EQ(szVersion, "5");
+}
+
+TEST_F(Library, CompatibilityDatabaseOfTwoFiles) {
+    Write("/etc/portforward/router_upnp.db", "[a/b/1]\nsupport=No\n[AirPort//]\nsupport=YES\nmax=5\n");
+    Write("/etc/portforward/router_upnp.db.user", "[a/b/2]\nsupport=no\nmax=7\n");
+    const char* rgszCases[][4] = {{"a", "b", "1", "no"}, {"AirPort", "x", "y", "yes"}, {"a", "b", "2", "unknown"}};
+    for (const auto& rgszCase : rgszCases) {
+        std::string szSupport;
+        EXPECT_TRUE(RouterUpnpDB(rgszCase[0], rgszCase[1], rgszCase[2]).GetSupport(szSupport));
+        EXPECT_EQ(szSupport, rgszCase[3]) << rgszCase[2];
+    }
+    int nMax = 0;
+    EXPECT_FALSE(RouterUpnpDB("a", "b", "1").GetMaxRule(nMax));
+    EXPECT_EQ(nMax, -1);
+    EXPECT_TRUE(RouterUpnpDB("a", "b", "2").GetMaxRule(nMax));
+    EXPECT_EQ(nMax, 7);
+    EXPECT_FALSE(RouterUpnpDB("", "", "").IsValid());
+}
+
+struct Capacity {
+    const char* szPages;
+    const char* szPorts;
+    int nStatus;
+    int nLimit;
+    int nLimit2;
+};
+
+TEST_F(Library, ManualRouterLimits) {
+    const std::string szAll = "tcp=1\nudp=1\ntcp_udp=1\nchange router port=yes\n";
+    const Capacity rgCases[] = {
+        {"support range=single\nmax rule=10\n", "1,2,3,5-6", 11, 10, 0},
+        {"max rule=10\n", "1,2,3,5-6", 10, 10, 0},
+        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,3,4,5,6,7,8,9,10,11", 12, 10, 4},
+        {"max rule=0\n[PF range page]\nmax rule=4\n", "1", 10, -1, 0},
+        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,5-6", 0, 0, 0},
+    };
+    for (const Capacity& capacity : rgCases) {
+        MakeManual("[PF port page]\n" + szAll + capacity.szPages);
+        std::filesystem::remove(kRuleConf);
+        Rule rule = MakeRule("1", capacity.szPorts);
+        SaveResult result = {};
+        const int nResult = TLibSaveRules("192.168.1.1", 1, &rule, true, &result, nullptr, nullptr);
+        EXPECT_EQ(nResult, capacity.nStatus == 0 ? 0 : -1) << capacity.szPages;
+        EXPECT_EQ(result.nStatus, capacity.nStatus) << capacity.szPages;
+        EXPECT_EQ(result.nLimit, capacity.nLimit);
+        EXPECT_EQ(result.nLimit2, capacity.nLimit2);
+        EXPECT_EQ(std::filesystem::exists("/tmp/ran"), nResult == 0);
+        EXPECT_EQ(std::filesystem::exists(kRuleConf), nResult == 0);
+    }
+}
+
+TEST_F(Library, SaveRefusesBadArgumentsBeforeAnyWork) {
+    MakeManual("[PF port page]\nmax rule=1\n");
+    Rule rule = MakeRule("1", "1");
+    SaveResult result = {};
+    const auto fnNote = [](const SaveResult*, void*) { FAIL(); };
+    struct {
+        const char* szIP;
+        int nRules;
+        Rule* pRules;
+        SaveResult* pResult;
+        bool blCallback;
+        const char* szLine;
+    } rgCases[] = {{nullptr, -1, nullptr, nullptr, true, "szGwRouterIP is NULL"},
+                   {"x", -1, nullptr, nullptr, true, "szGwRouterIP=x is not IP format"},
+                   {"1.2.3.4", -1, nullptr, nullptr, true, "saveResult is NULL"},
+                   {"1.2.3.4", -1, nullptr, &result, true, "fail: 0 > nRules=-1"},
+                   {"1.2.3.4", 1, nullptr, &result, true, "rgRules is NULL"}};
+    for (const auto& refused : rgCases) {
+        gLog.clear();
+        EXPECT_EQ(TLibSaveRules(refused.szIP, refused.nRules, refused.pRules, true, refused.pResult,
+                                refused.blCallback ? +fnNote : nullptr, nullptr),
+                  -1);
+        EXPECT_EQ(gLog, std::vector<std::string>{refused.szLine});
+    }
+    EXPECT_FALSE(std::filesystem::exists("/etc/tavoinfo.conf"));
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    EXPECT_EQ(TLibSaveRules("192.168.1.1", 1, &rule, true, &result, nullptr, nullptr), -1);
+    EXPECT_EQ(result.nStatus, 2);
+    EXPECT_EQ(result.nProgress, 20);
+    TLibTavoPortMapUnLock();
+    rule.szRouterPort[0] = rule.szSrcPort[0] = '\0';
+    RouterRuleConfWriter writer;
+    EXPECT_FALSE(std::filesystem::exists("/etc/tavoinfo.conf"));
+    rule.szProtocol[0] = '\0';
+    EXPECT_EQ(TLibSaveRules("192.168.1.1", 1, &rule, true, &result, nullptr, nullptr), -1);
+    EXPECT_TRUE(Logged("protocol, and port should not be empty"));
+}
+
+TEST_F(Library, DaemonStatusIsReadBack) {
+    Write("/usr/tavo/sbin/upnpd", "#!/bin/sh\nwhile :; do /bin/sleep 1; done\n");
+    chmod("/usr/tavo/sbin/upnpd", 0755);
+    UpnpDaemon daemon;
+    bool blConflict = true, blError = true;
+    std::string szConflict, szError;
+    EXPECT_FALSE(daemon.CheckDaemon(blConflict, blError, szConflict, szError));
+    EXPECT_TRUE(Logged("upnpd is not ready"));
+    ASSERT_TRUE(daemon.Start());
+    EXPECT_TRUE(std::filesystem::exists("/tmp/pfProgress"));
+    EXPECT_EQ(IsSavingRules(), 1);
+    Write("/var/tmp/upnp_portmap.status", "a=1\nb=718\nno value\nc=501\nd=718\n");
+    EXPECT_TRUE(daemon.CheckDaemon(blConflict, blError, szConflict, szError));
+    EXPECT_EQ(szConflict + "|" + szError, "b, d|c");
+    std::filesystem::remove("/var/tmp/upnp_portmap.status");
+    EXPECT_FALSE(daemon.CheckDaemon(blConflict, blError, szConflict, szError));
+    EXPECT_EQ(gNSlept, 22);
+    TLIBCKill("upnpd", SIGKILL);
+    std::filesystem::remove("/tmp/pfProgress");
+}
+
+}  // namespace

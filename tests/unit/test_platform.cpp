@@ -1,0 +1,135 @@
+// The platform: files that survive any value and any failure, processes, port lists, the database.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <thread>
+
+#include "core/TextFile.h"
+#include "portforward/PortText.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
+#include "world.h"
+
+namespace {
+
+constexpr char kPath[] = "/tmp/t/file";
+
+TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
+    const std::vector<std::string> rgValues = {"",      "plain", "two words",    "x\"; [192.168.1.1]\nuser=\"me",
+                                               "\\",    "\\\"",  "a=b#c",        "\r\n\t\x01\x7f",
+                                               "ärger", "[x]",   "' $(id) `id`", std::string(10000, '"')};
+    std::filesystem::create_directories("/tmp/t");
+    for (const std::string& szValue : rgValues) {
+        for (const std::string& szName : {std::string("s"), szValue}) {
+            std::filesystem::remove(kPath);
+            TLIBCSzHash* pHash = TLIBCSzHashAlloc(4);
+            TLIBCSzHashSetValue(pHash, "protocol name", szValue.c_str());
+            if (!szValue.empty()) {
+                TLIBCSzHashSetValue(pHash, szValue.c_str(), "by key");
+            }
+            ASSERT_EQ(TLIBCFileAddSection(kPath, szName.c_str(), pHash, 0), 1);
+            ASSERT_EQ(TLIBCFileAddSection(kPath, "other", pHash, 0), 1);
+            TLIBCSzHash* pRead = TLIBCSzHashAlloc(4);
+            EXPECT_EQ(TLIBCFileGetSection(kPath, szName.c_str(), pRead), TLIBCSzHashCount(pHash)) << szValue;
+            EXPECT_STREQ(TLIBCSzHashGetValue(pRead, "protocol name"), szValue.c_str());
+            TLIBCSzHashFree(pRead);
+            TLIBCSzHashFree(pHash);
+            EXPECT_EQ(tavo::ParseSections(Read(kPath))->size(), 2U) << szValue;
+        }
+    }
+    struct stat status = {};
+    stat(kPath, &status);
+    EXPECT_EQ(status.st_mode & 0777U, 0600U);
+}
+
+TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
+    EXPECT_EQ(tavo::ParseSections("# c\r\n\r\n [a] \r\nk = plain text \nq=\"x\" # c\n")->front().rgPairs[0].szValue,
+              "plain text");
+    for (const char* szBad : {"k=v\n", "[a]\nnonsense\n", "[a]\nk=\"open\n", "[a]\nk=\"\\q\"\n", "[a]\nk=\"x\" y\n",
+                              "[a]\nk=\"\\x00\"\n", "[a]\n=v\n"}) {
+        EXPECT_FALSE(tavo::ParseSections(szBad)) << szBad;
+    }
+}
+
+TEST(KeyFile, ChangesOneLineAndCanBeSourced) {
+    Write(kPath, "# kept\na=\"1\"\n  odd line\nb='2'\n");
+    EXPECT_EQ(TLIBCFileSetKeyValue(kPath, "a", "x\"$(id)`id`\\", "%s=\"%s\"\n"), 1);
+    EXPECT_EQ(TLIBCFileSetKeyValue(kPath, "c", "3", nullptr), 1);
+    EXPECT_EQ(Read(kPath), "# kept\na=\"x\\\"\\$(id)\\`id\\`\\\\\"\n  odd line\nb='2'\nc=\"3\"\n");
+    char szValue[64] = "untouched";
+    EXPECT_GE(TLIBCFileGetKeyValue(kPath, "a", szValue, sizeof(szValue), 0), 1);
+    EXPECT_STREQ(szValue, "x\"$(id)`id`\\");
+    EXPECT_LT(TLIBCFileGetKeyValue(kPath, "absent", szValue, sizeof(szValue), 0), 0);
+    EXPECT_LT(TLIBCFileSetKeyValue(kPath, "k", "v", "%s=%d\n"), 0);
+}
+
+TEST(KeyFile, TwoWritersLoseNothing) {
+    std::filesystem::remove(kPath);
+    const auto fnWrite = [](char cName) {
+        for (int i = 0; i < 40; ++i) {
+            TLIBCFileSetKeyValue(kPath, (std::string(1, cName) + std::to_string(i)).c_str(), "v", nullptr);
+        }
+    };
+    std::thread other(fnWrite, 'a');
+    fnWrite('b');
+    other.join();
+    TLIBCSzHash* pHash = nullptr;
+    EXPECT_EQ(TLIBCFileGetKeys(kPath, nullptr, &pHash, "="), 80);
+    TLIBCSzHashFree(pHash);
+}
+
+TEST(AtomicWrite, AFailureLeavesTheOldFileAndNothingElse) {
+    std::filesystem::remove_all("/tmp/t");
+    Write(kPath, "old");
+    chmod(kPath, 0640);
+    ASSERT_TRUE(tavo::WriteFileAtomic(kPath, "new"));
+    struct stat status = {};
+    stat(kPath, &status);
+    EXPECT_EQ(status.st_mode & 0777U, 0640U);
+    mkdir("/tmp/t/full", 0755);
+    EXPECT_FALSE(tavo::WriteFileAtomic("/tmp/t/full", "text"));  // a directory is in the way
+    EXPECT_EQ(Read(kPath), "new");
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator("/tmp/t"), {}), 2);
+    Write("/var/victim", "safe");
+    symlink("/var/victim", "/tmp/trap");
+    EXPECT_TRUE(tavo::WriteFileAtomic("/tmp/trap", "mine"));  // everybody's directory: no link is followed
+    EXPECT_EQ(Read("/var/victim"), "safe");
+}
+
+TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
+    Write("/tmp/t/testupnp.sh", "#!/bin/sh\nwhile :; do /bin/sleep 1; done\n");
+    chmod("/tmp/t/testupnp.sh", 0755);
+    EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
+    const int fd = open("/tmp/t/held", O_RDWR | O_CREAT, 0600);  // deliberately inheritable
+    ASSERT_EQ(TLIBCExec("/tmp/t/testupnp.sh", "--one", nullptr, nullptr, nullptr), 0);
+    EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 1);
+    EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh --one"), 1);
+    EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh"), 0);
+    const std::string szPids =
+        "for p in /proc/[0-9]*; do grep -qs testupnp.sh $p/cmdline && ls -l $p/fd; done "
+        "2>/dev/null | grep -q /tmp/t/held";
+    EXPECT_NE(TLIBCSystem(szPids.c_str()), 0);
+    close(fd);
+    EXPECT_EQ(TLIBCKill("testupnp.sh", SIGKILL), 1);
+    for (int i = 0; i < 500 && TLIBCIsProcAlive("testupnp.sh") == 1; ++i) {
+        usleep(10000);
+    }
+    EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
+    EXPECT_EQ(TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr), -1);
+    EXPECT_EQ(TLIBCSystem("exit 3"), 3);
+}
+
+TEST(Rules, AreTakenApartPairByPair) {
+    using M = tavo::SingleMapping;
+    EXPECT_EQ(*tavo::ExpandRule("ALL", "80", "8080"), (std::vector<M>{{"TCP", 80, 8080}, {"UDP", 80, 8080}}));
+    EXPECT_EQ(*tavo::ExpandRule("tcp", "12-10, 1", "20-22,7"),
+              (std::vector<M>{{"TCP", 10, 20}, {"TCP", 11, 21}, {"TCP", 12, 22}, {"TCP", 1, 7}}));
+    const char* rgszBad[][3] = {{"tcp", "1-3", "1-2"}, {"icmp", "1", "1"}, {"tcp", "", ""},    {"tcp", "0", "1"},
+                                {"tcp", "65536", "1"}, {"tcp", "1x", "1"}, {"tcp", "1,", "1"}, {"tcp", "1-", "1"}};
+    for (const auto& rgszRule : rgszBad) {
+        EXPECT_FALSE(tavo::ExpandRule(rgszRule[0], rgszRule[1], rgszRule[2])) << rgszRule[1];
+    }
+}
+
+}  // namespace

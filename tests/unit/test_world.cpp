@@ -1,0 +1,50 @@
+// Stand-ins that the dynamic linker prefers over the C library's and the platform's own.
+#include <dlfcn.h>
+#include <gtest/gtest.h>
+#include <syslog.h>
+
+#include <cstdarg>
+#include <cstdio>
+#include <cstring>
+
+#include "world.h"
+
+std::vector<std::string> gLog;
+std::string gSzFailRename;
+std::string gSzGateway = "192.168.1.1";
+int gNSlept = 0;
+
+extern "C" {
+
+void syslog(int /*nPriority*/, const char* szFormat, ...) {
+    char szLine[8192];
+    va_list args;
+    va_start(args, szFormat);
+    vsnprintf(szLine, sizeof(szLine), szFormat, args);
+    va_end(args);
+    const std::string szText = szLine;
+    gLog.push_back(szText.substr(szText.find(' ') + 1));
+}
+
+int rename(const char* szFrom, const char* szTo) {
+    if (gSzFailRename == szFrom) {
+        gSzFailRename.clear();
+        return -1;
+    }
+    static const auto fnReal = reinterpret_cast<int (*)(const char*, const char*)>(dlsym(RTLD_NEXT, "rename"));
+    return fnReal(szFrom, szTo);
+}
+
+unsigned sleep(unsigned nSeconds) {
+    gNSlept += static_cast<int>(nSeconds);
+    return 0;
+}
+
+int TAVONetDefaultGatewayGet(char* szGateway, int nSize) {
+    if (gSzGateway.empty()) {
+        return -1;
+    }
+    snprintf(szGateway, static_cast<size_t>(nSize), "%s", gSzGateway.c_str());
+    return 0;
+}
+}

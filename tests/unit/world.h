@@ -1,0 +1,37 @@
+// What the tests share: the log lines of the system log, files at their fixed places, a fake gateway.
+#pragma once
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <vector>
+
+// Every line that went to syslog, without its "file:line " prefix.
+extern std::vector<std::string> gLog;
+// What the next rename of this source path does: fail, once.
+extern std::string gSzFailRename;
+// The default gateway that the platform reports; empty: none.
+extern std::string gSzGateway;
+// Seconds slept; sleep() only counts.
+extern int gNSlept;
+
+inline void Write(const std::string& szPath, const std::string& szText) {
+    std::filesystem::create_directories(std::filesystem::path(szPath).parent_path());
+    std::ofstream(szPath) << szText;
+}
+
+inline std::string Read(const std::string& szPath) {
+    std::ostringstream text;
+    text << std::ifstream(szPath).rdbuf();
+    return text.str();
+}
+
+inline bool Logged(const std::string& szLine) {
+    for (const std::string& szSeen : gLog) {
+        if (szSeen == szLine) {
+            return true;
+        }
+    }
+    return false;
+}
