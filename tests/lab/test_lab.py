@@ -145,6 +145,55 @@ class NoRouter(unittest.TestCase):
         self.assertEqual(LAB.read("/etc/portforward/router.conf"), "this is no router file\n")
 
 
+class FaultyRouter(unittest.TestCase):
+    """Each fault: the ports saved, status, refused ports, why, entries of the box, and a bound in seconds."""
+    one, many = range(5001, 5002), range(5001, 5041)
+    table = (
+        ("none", one, 0, "", {}, 1, 5),
+        ("conflict_foreign", range(5001, 5003), 8, "5001/tcp", {"5001/tcp": "718"}, 1, 5),
+        ("conflict_secure", range(5001, 5003), 8, "5001/tcp", {"5001/tcp": "718"}, 1, 5),
+        ("only_permanent", many, 0, "", {}, 40, 10),
+        ("invalid_args_402", one, 0, "", {}, 1, 5),
+        ("action_failed_501", one, 9, "5001/tcp", {"5001/tcp": "501"}, 0, 5),
+        ("full_at_32", many, 9, ", ".join(f"{port}/tcp" for port in range(5033, 5041)),
+         {"5033/tcp": "lost"}, 32, 10),
+        ("keeps_nothing", one, 9, "5001/tcp", {"5001/tcp": "lost"}, 0, 5),
+        ("lease_cut", one, 0, "", {}, 1, 5),
+        ("late_reply", range(5001, 5005), 9, "5001/tcp, 5002/tcp, 5003/tcp, 5004/tcp", {"5004/tcp": "timeout"}, None, 25),
+        ("endless_table", one, 0, "", {}, 1, 5),
+        ("silent", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("endless_body", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("half_reply", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("garbage_xml", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("location_other_host", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("location_loopback", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+    )
+
+    def test_faults(self):
+        for fault, ports, status, refused, why, entries, bound in self.table:
+            with self.subTest(fault=fault):
+                LAB.install()
+                LAB.start_scripted(fault)
+                try:
+                    answer = LAB.save(*(f"{port},1,tcp,{port},{port}" for port in ports), seconds=bound)
+                    self.assertEqual((answer["status"], answer["ports"]), (status, refused))
+                    self.assertEqual(why, {key: value for key, value in LAB.status().items() if key in why})
+                    state = LAB.scripted()
+                    self.assertTrue(state["count"].get("ssdp"), "the fault was reached")
+                    ours = [row for row in state["table"] if row[2] == BOX]
+                    if entries is not None:
+                        self.assertEqual(len(ours), entries)
+                    if fault.startswith("location"):
+                        self.assertNotIn("/d.xml", state["count"])
+                    if fault == "only_permanent":  # learnt once, not once a rule
+                        self.assertEqual(state["count"]["AddPortMapping"], 41)
+                finally:
+                    LAB.stop_daemon(signal.SIGKILL)
+                    LAB.end(LAB.router)
+                    if os.path.exists("/var/lib/tavo/upnp_igd.conf"):
+                        os.unlink("/var/lib/tavo/upnp_igd.conf")
+
+
 def main(lab):
     global LAB
     LAB = lab
