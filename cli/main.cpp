@@ -54,6 +54,7 @@ int Answer(Exit enExit, const std::string& szMessage, Json::Value jsAnswer = Jso
 std::optional<Rules> LoadRules() {
     Rules rules;
     __tag_TAVO_ROUTER_RULE* pRules = nullptr;
+    RouterRuleConfReader(false).StartNextRule();  // brings back the rules that a killed writer left aside
     if (TLibGetRulesArrFromRuleConf(&rules.nRules, &pRules, nullptr, false, nullptr) != 0) {
         return std::nullopt;
     }

@@ -120,6 +120,15 @@ TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
     }
 }
 
+TEST_F(Library, RulesOfAKilledWriterComeBackAndReplaceNothing) {
+    Write("/etc/portforward/rule.confaB3dE6", "[9]\nenabled=1\n");
+    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
+    EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
+    Write("/etc/portforward/rule.confaB3dE6", "[8]\nenabled=1\n");
+    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
+    EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
+}
+
 TEST_F(Library, RouterConfWriterKeepsOrDropsOtherGateways) {
     const std::string szBoth = "[10.0.0.1]\nbrand=\"old\"\n\n[192.168.1.1]\nbrand=\"mine\"\nuser=\"u\"\n";
     Write(kRouterConf, szBoth);

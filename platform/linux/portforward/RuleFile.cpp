@@ -1,10 +1,14 @@
 // Rule and router files as lists of nodes, and the counts that the capacity checks use.
 // Relies on TextFile and on the description of the router for the count of jobs.
 // Promises: a list is whole or absent; a file is replaced whole or left alone.
+#include <fcntl.h>
+#include <syslog.h>
+
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <new>
 
 #include "core/Border.h"
@@ -18,11 +22,37 @@ constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr int kMaxPort = 65535;
+constexpr size_t kAsideSuffix = 6;
 
 using tavo::AtBorder;
 using tavo::ConfList;
 
+// A writer that was killed between moving the old file aside (its name and six more characters) and
+// writing the new one leaves neither: the newest copy comes back. It never replaces a file, so it is
+// harmless while a writer is at work.
+void RecoverAside(const char* szPath) {
+    if (TLIBCFileExist(szPath) == 1) {
+        return;
+    }
+    namespace fs = std::filesystem;
+    const fs::path path(szPath);
+    const std::string szName = path.filename();
+    std::error_code error;
+    fs::path newest;
+    for (fs::directory_iterator it(path.parent_path(), error), end; !error && it != end; it.increment(error)) {
+        const std::string szSeen = it->path().filename();
+        const bool blCopy = szSeen.size() == szName.size() + kAsideSuffix && szSeen.starts_with(szName);
+        if (blCopy && (newest.empty() || fs::last_write_time(newest, error) < it->last_write_time(error))) {
+            newest = it->path();
+        }
+    }
+    if (!newest.empty() && renameat2(AT_FDCWD, newest.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
+        syslog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest.c_str());
+    }
+}
+
 TAVO_PF_CONF* Load(const char* szPath) {
+    RecoverAside(szPath);
     return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] { return tavo::LoadConfList(szPath).release(); });
 }
 

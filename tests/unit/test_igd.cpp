@@ -1,0 +1,151 @@
+// The IGD client against hostile answers, and Reconcile against a router in memory.
+#include <gtest/gtest.h>
+
+#include <map>
+
+#include "daemons/common/Reconcile.h"
+#include "upnp/Igd.h"
+#include "upnp/Ssdp.h"
+
+namespace {
+
+using tavo::RouterMapping;
+
+TEST(Ssdp, OnlyTheGatewayItselfCounts) {
+    const std::pair<const char*, bool> rgCases[] = {
+        {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", true},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.2:5000/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1@evil/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://a:b@192.168.1.1/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: https://192.168.1.1/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: file:///etc/passwd\r\n\r\n", false},
+        {"HTTP/1.1 404 No\r\nLOCATION: http://192.168.1.1/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\n\r\n", false},
+        {"", false}};
+    for (const auto& [szAnswer, blGood] : rgCases) {
+        std::string szReason;
+        EXPECT_EQ(tavo::LocationOf(szAnswer, "192.168.1.1", szReason).has_value(), blGood) << szAnswer;
+        EXPECT_EQ(szReason.empty(), blGood);
+    }
+    for (const char* szOwn : {"127.0.0.1", "169.254.1.1"}) {
+        std::string szReason;
+        const std::string szAnswer = std::string("HTTP/1.1 200 OK\r\nLOCATION: http://") + szOwn + "/x\r\n\r\n";
+        EXPECT_FALSE(tavo::LocationOf(szAnswer, szOwn, szReason));
+    }
+}
+
+TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
+    const tavo::HttpUrl location{"192.168.1.1", 80, "/dir/root.xml"};
+    const auto fnControl = [&](const std::string& szControl, const std::string& szExtra) {
+        const auto service = tavo::ParseDescription("<root>" + szExtra +
+                                                        "<d><d><service><serviceType>urn:schemas-upnp-org:service:"
+                                                        "WANPPPConnection:1</serviceType><controlURL>" +
+                                                        szControl + "</controlURL></service></d></d></root>",
+                                                    location);
+        return service ? service->control.Text() : "";
+    };
+    EXPECT_EQ(fnControl("/ctl?a=b", ""), "http://192.168.1.1:80/ctl?a=b");
+    EXPECT_EQ(fnControl("ctl", ""), "http://192.168.1.1:80/dir/ctl");
+    EXPECT_EQ(fnControl("/c", "<URLBase>http://192.168.1.1:99/</URLBase>"), "http://192.168.1.1:99/c");
+    EXPECT_EQ(fnControl("/c", "<URLBase>http://10.0.0.9/</URLBase>"), "http://192.168.1.1:80/c");
+    EXPECT_EQ(fnControl("http://10.0.0.9/c", ""), "");
+    EXPECT_EQ(fnControl("", ""), "");
+    std::string szDeep;
+    for (int i = 0; i < 5000; ++i) {
+        szDeep += "<a>";
+    }
+    EXPECT_FALSE(tavo::ParseDescription(szDeep, location));
+    EXPECT_FALSE(tavo::ParseDescription("", location));
+}
+
+TEST(Igd, AnswersThatAreNoneAreGarbage) {
+    EXPECT_EQ(tavo::SoapCode(200, "<e><Body><r/></Body></e>"), tavo::kRouterOk);
+    EXPECT_EQ(tavo::SoapCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);
+    for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>"}) {
+        EXPECT_EQ(tavo::SoapCode(200, szXml), tavo::kRouterGarbage) << szXml;
+    }
+    EXPECT_EQ(tavo::SoapCode(404, "<e><Body><r/></Body></e>"), tavo::kRouterGarbage);
+}
+
+class MemoryRouter : public tavo::Router {
+public:
+    int List(std::vector<RouterMapping>& rgMappings) override {
+        ++mNCalls;
+        for (const auto& [key, mapping] : mMapTable) {
+            rgMappings.push_back(mapping);
+        }
+        return mNListCode;
+    }
+    int Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+        ++mNCalls;
+        const auto it = mMapTable.find({szProtocol, nPort});
+        if (it == mMapTable.end()) {
+            return tavo::kRouterNoSuchEntry;
+        }
+        mapping = it->second;
+        return tavo::kRouterOk;
+    }
+    int Add(const RouterMapping& mapping) override {
+        ++mNCalls;
+        mMapTable[{mapping.szProtocol, mapping.nRouterPort}] = mapping;
+        return tavo::kRouterOk;
+    }
+    int Remove(const std::string& szProtocol, uint16_t nPort) override {
+        ++mNCalls;
+        return mMapTable.erase({szProtocol, nPort}) == 1 ? tavo::kRouterOk : tavo::kRouterNoSuchEntry;
+    }
+
+    std::map<std::pair<std::string, uint16_t>, RouterMapping> mMapTable;
+    int mNListCode = tavo::kRouterOk;
+    int mNCalls = 0;
+};
+
+constexpr char kBox[] = "192.168.1.5";
+
+RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, const char* szText) {
+    return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
+}
+
+TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
+    MemoryRouter router;
+    for (const RouterMapping& mapping :
+         {Entry(1, 1, kBox, "tavo:a"), Entry(2, 2, kBox, "tavo:gone"), Entry(3, 9, kBox, "tavo:moved"),
+          Entry(4, 4, "192.168.1.9", "tavo:theirs"), Entry(5, 5, kBox, "game"), Entry(6, 9, kBox, "game")}) {
+        router.Add(mapping);
+    }
+    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a"), Entry(3, 3, "", "tavo:moved"),
+                                                 Entry(4, 4, "", "tavo:d"), Entry(5, 5, "", "tavo:e"),
+                                                 Entry(6, 6, "", "tavo:f"), Entry(7, 7, "", "tavo:g")};
+    tavo::LeaseHabit habit;
+    const auto fnGoOn = [] { return false; };
+    const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn);
+    const std::vector<std::pair<std::string, std::string>> rgExpected = {
+        {"1/tcp", "1"}, {"3/tcp", "1"}, {"4/tcp", "718"}, {"5/tcp", "1"}, {"6/tcp", "718"}, {"7/tcp", "1"}};
+    EXPECT_EQ(result.rgStatus, rgExpected);
+    EXPECT_EQ(router.mMapTable.size(), 6U);
+    EXPECT_EQ(router.mMapTable.count({"TCP", 2}), 0U);
+    EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
+    EXPECT_EQ((router.mMapTable[{"TCP", 6}].nBoxPort), 9);
+    EXPECT_EQ((router.mMapTable[{"TCP", 4}].szClient), "192.168.1.9");
+    EXPECT_EQ(result.nShortestLease, 100U);
+
+    router.mNCalls = 0;
+    EXPECT_EQ(tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn).rgStatus, rgExpected);
+    EXPECT_EQ(router.mNCalls, 1);
+    tavo::Reconcile(router, rgWanted, kBox, habit, true, fnGoOn);  // leases due: each own one asked for again
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), habit.nLease);
+    EXPECT_EQ((router.mMapTable[{"TCP", 5}].szDescription), "game");
+}
+
+TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {
+    MemoryRouter router;
+    router.Add(Entry(2, 2, kBox, "tavo:old"));
+    router.mNListCode = tavo::kRouterTimeout;
+    tavo::LeaseHabit habit;
+    const auto result = tavo::Reconcile(router, {Entry(1, 1, "", "tavo:a")}, kBox, habit, false, [] { return false; });
+    EXPECT_EQ(result.rgStatus.front().second, "timeout");
+    EXPECT_EQ(result.nTransport, tavo::kRouterTimeout);
+    EXPECT_EQ(router.mMapTable.size(), 1U);
+}
+
+}  // namespace
