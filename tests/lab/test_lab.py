@@ -88,8 +88,9 @@ class RealRouter(unittest.TestCase):
         self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
         wanted = {("tcp", 5001): (BOX, 5001)}
         self.assertEqual(LAB.mappings(), wanted)
-        LAB.reboot_router(port=5555)
+        LAB.stop_router()
         self.assertEqual(LAB.mappings(), {})
+        LAB.start_router(port=5555)
         wait_for(lambda: LAB.mappings() == wanted, 30, "the mapping is back after the reboot")
 
     def test_saver_killed_in_mid_save_leaves_whole_rules(self):
