@@ -193,8 +193,9 @@ typedef struct __tag_TAVO_PORTMAP_RULE {
 } __tag_TAVO_PORTMAP_RULE;
 TAVO_LAYOUT(sizeof(__tag_TAVO_PORTMAP_RULE) == 8 + 1024, "request layout");
 
-/* A parsed section of a configuration file, of the platform's port-forward library. */
+/* A parsed section of a configuration file, and a string hash, of the platform's libraries. */
 struct _tag_tavo_pf_conf;
+struct tag_TLIBC_SZHASH;
 
 /* ---- support words, rule arrays ----------------------------------------------------------------- */
 
@@ -249,6 +250,32 @@ TAVO_API int TLibGetRouterDesc(const char* szGwRouterIP, __tag_TAVO_ROUTER_DESC*
                                __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
 /* Rule syntax version of the installed port-forward tool; -1 when it tells none. */
 TAVO_API int IGetCurrSyntaxVersion(void);
+
+/* ---- router settings ------------------------------------------------------------------------------ */
+
+/* The settings of the router behind szGwRouterIP; zero the record first: a field that is not stored, or
+ * that this kind of router does not have, keeps what it held. 0: filled; 1: nothing is stored for this
+ * gateway; -1: failed. pErr may be NULL: 0, or 2 when blLock asked for the router lock and it was held. */
+TAVO_API int TLibGetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf,
+                               __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
+/* Makes the record the only section of router.conf, named by the current gateway. Account and connection
+ * are stored for a manual router only (neither support word is "yes"), szMaxRule never. 0 or -1; after a
+ * failure the settings are as they were. pErr may be NULL: 1, also after success; 2: the lock was held;
+ * 6: the router's description is newer than the port-forward tool. */
+TAVO_API int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf,
+                               __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
+
+/* ---- detection ------------------------------------------------------------------------------------ */
+
+/* Finds out what the gateway is; takes several seconds. The callback is called on this thread after each
+ * change of nProgress and once at the end, with NULL when detectResult is NULL. 0 or -1; detectResult has
+ * the reason. One child process is forked; where that child cannot tell the gateway's address it returns
+ * from this function with -1: a caller that must not be doubled compares its pid. */
+TAVO_API int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult,
+                              void (*pfnCallback)(const __tag_TAVO_ROUTER_DETECT_RESULT*, void*), void* arg,
+                              bool blLock);
+/* What the last detection, of any process, found; nProgress to szInterface are not filled. 0 or -1. */
+TAVO_API int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult);
 
 /* ---- saving rules ------------------------------------------------------------------------------- */
 
@@ -485,6 +512,109 @@ private:
     std::string mSzSection;
     _tag_tavo_pf_conf* mPSection;
 };
+
+/* Where the answer of the last detection is cached, and the key that holds the router's state. */
+TAVO_API extern const std::string SZF_DETECT_MANUAL_CACHE;
+TAVO_API extern const std::string SZ_ROUER_INIT;
+
+namespace DetectCache {
+/* "unknown", "not_initialized", "upnp_natpmp", "manual"; empty for another value. */
+TAVO_API std::string ToString(__TAG_TAVO_ROUTER_INIT_STATE enState);
+TAVO_API bool IsCacheExisted();
+}  // namespace DetectCache
+
+/* Reads one gateway's section of the detection cache. */
+class TAVO_API DetectCacheReader {
+public:
+    explicit DetectCacheReader(const std::string& section);
+    ~DetectCacheReader();
+    DetectCacheReader(const DetectCacheReader&) = delete;
+    DetectCacheReader& operator=(const DetectCacheReader&) = delete;
+
+    /* Loads the section, once. */
+    int Init();
+    /* Loads it where that has not been done; 0 when the file could not be read. */
+    int IsSectionExisted(bool& blExisted);
+    /* These do not load: 0 before IsSectionExisted() or Init() found the section. */
+    int GetType(__TAG_TAVO_ROUTER_INIT_STATE& enState);
+    int GetBrand(std::string& brand);
+    int GetModel(std::string& model);
+    int GetVersion(std::string& version);
+
+private:
+    int mEnReaderState;
+    tag_TLIBC_SZHASH* mPHash;
+    std::string mSzSection;
+};
+
+/* Replaces the detection cache by one section. */
+class TAVO_API DetectCacheWriter {
+public:
+    explicit DetectCacheWriter(const std::string& section);
+    ~DetectCacheWriter();
+    DetectCacheWriter(const DetectCacheWriter&) = delete;
+    DetectCacheWriter& operator=(const DetectCacheWriter&) = delete;
+
+    int Init();
+    /* Call it after one of the other setters: it does not make the table that they fill. */
+    int SetType(__TAG_TAVO_ROUTER_INIT_STATE enState);
+    int SetBrand(const std::string& brand);
+    int SetModel(const std::string& model);
+    int SetVersion(const std::string& version);
+    /* Deletes the old cache, then writes; a failure leaves no cache. */
+    int Sync();
+
+private:
+    tag_TLIBC_SZHASH* mPHash;
+    std::string mSzSection;
+};
+
+/* Records the gateway section as a manual router. 1 or 0. */
+TAVO_API int SetDetectManualCache(const std::string& section, const std::string& brand, const std::string& model,
+                                  const std::string& version);
+/* Deletes the cache; always 1. */
+TAVO_API int CleanDetectManualCache();
+
+/* Whether the gateway speaks UPnP, what it is and whether it is known to work. The result outlives the
+ * process; the readers show the last one, of whichever process, and an empty text where there is none. */
+class TAVO_API UpnpDetector {
+public:
+    UpnpDetector();
+    ~UpnpDetector();
+
+    /* One detection. True also when there is no UPnP; false: another detection runs, the result could not
+     * be stored, or the model has no name to look up. */
+    bool Start();
+    std::string GetStr(const std::string& key);
+    std::string GetPfPath();
+    std::string GetVersion();
+    std::string GetBrand();
+    std::string GetModel();
+    std::string GetSupportUpnp();
+    bool IsAbleToGetBrandModelVersion();
+};
+
+/* Whether the gateway is a base station to be driven through NAT-PMP; as above. */
+class TAVO_API NatpmpDetector {
+public:
+    NatpmpDetector();
+    ~NatpmpDetector();
+
+    /* One detection, about six seconds at most. True also when the gateway is no such router. */
+    bool Start(const char* szGatewayIP);
+    std::string GetStr(const std::string& key);
+    std::string GetVersion();
+    std::string GetBrand();
+    std::string GetUserSettingName();
+    std::string GetModel();
+    std::string GetSupportNatpmp();
+};
+
+namespace DETECT_INFO {
+/* Condenses what the two detectors stored into the record. 0, or -1: null, or a router that is supported
+ * but whose maximum nobody knows. */
+TAVO_API int fillRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult);
+}  // namespace DETECT_INFO
 
 /* Control of the UPnP port-mapping daemon. */
 class TAVO_API UpnpDaemon {

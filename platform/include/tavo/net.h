@@ -15,11 +15,42 @@ int BlTLIBIsIpAddr(const char* szText);
 /* The box's own IPv4 address that faces szPeer (the preferred source of the route to it), and, when
  * szInterface is not null, the interface's name. 0: found; -1: not, outputs untouched. */
 int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* szInterface, int nInterfaceSize);
-/* 1: both IPv4 addresses are on one of the box's directly connected subnets; 0: they are not; -1: bad input. */
-int TAVONetIsSameSubnet(const char* szOne, const char* szOther);
+/* 1: both IPv4 addresses are on the subnet that szMask (dotted) makes of them; 0: they are not; -1: bad input. */
+int TAVONetIsSameSubnet(const char* szOne, const char* szOther, const char* szMask);
 
+/* One interface with an IPv4 address; all texts NUL-terminated. */
+typedef struct tag_TAVO_NET_CARD {
+    char szName[16];
+    char szAddress[16];
+    char szMask[16];
+} TAVO_NET_CARD;
+
+/* Up to nRoom interfaces of a kind (1: all; 2: up, with an IPv4 address, no loopback), by index.
+ * Number of interfaces filled in; -1: netlink failed, or bad input. */
+int TLIBNetGetInterfaceInfo(TAVO_NET_CARD* rgCards, int nRoom, int nKind);
+/* The interface at nIndex (from 0) of kind 2. 1: *pCard filled; 0: no such index; -1: failed. */
+int TAVONetGetCard1(int nIndex, TAVO_NET_CARD* pCard);
+
+/* ---- checks of the network that the box is in; 0: passed, -1: not ------------------------------- */
+
+/* The interface towards the gateway (without a gateway: any but loopback) is up and has an address.
+ * szInterface: its name, also when it fails and there is one. */
+int checkGwIfEnable(char* szInterface, int nSize);
+/* There is a default gateway and it is on a subnet of the box. szGateway: its address, empty when there
+ * is none. */
+int checkDefaultGatewaySetting(char* szGateway, int nSize);
+/* A host outside (platform.conf, [network]) can be reached. */
+int checkConnectToWAN(void);
+/* A name (platform.conf, [network]) can be resolved through the box's name servers. */
+int checkDNSSetting(void);
 #ifdef __cplusplus
 }
+
+/* How many address translations stand between the box and the public network: 0 for a public address,
+ * 1 behind the home router, more behind a second one or a carrier's. Looks at nHops routers at most and
+ * at what the gateway says of its outside address. 0: nLevel set; -1: it could not be told, nLevel
+ * untouched. */
+int getPublicIPLevel(int& nLevel, int nHops);
 #endif
 #pragma GCC visibility pop
 #endif

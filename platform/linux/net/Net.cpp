@@ -194,19 +194,13 @@ int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* s
     });
 }
 
-int TAVONetIsSameSubnet(const char* szOne, const char* szOther) {
-    return AtBorder(-1, [&] {
-        in_addr one = {};
-        in_addr other = {};
-        if (szOne == nullptr || szOther == nullptr || inet_pton(AF_INET, szOne, &one) != 1 ||
-            inet_pton(AF_INET, szOther, &other) != 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
-        }
-        bool blSame = false;
-        ForEachAddress([&](const InterfaceAddress& seen) {
-            const in_addr_t nNet = seen.address.s_addr & seen.mask.s_addr;
-            blSame = blSame || ((one.s_addr & seen.mask.s_addr) == nNet && (other.s_addr & seen.mask.s_addr) == nNet);
-        });
-        return blSame ? 1 : 0;
-    });
+int TAVONetIsSameSubnet(const char* szOne, const char* szOther, const char* szMask) {
+    in_addr one = {};
+    in_addr other = {};
+    in_addr mask = {};
+    if (szOne == nullptr || szOther == nullptr || szMask == nullptr || inet_pton(AF_INET, szOne, &one) != 1 ||
+        inet_pton(AF_INET, szOther, &other) != 1 || inet_pton(AF_INET, szMask, &mask) != 1) {
+        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+    }
+    return (one.s_addr & mask.s_addr) == (other.s_addr & mask.s_addr) ? 1 : 0;
 }
