@@ -3,8 +3,9 @@
  * read by any other. One record per owner and id.
  *
  * A record changes on disk only when an update ends, whole and at once: a writer that is killed in
- * between leaves the record as it was. Nothing is thrown; null pointers, and owners and ids that are no
- * plain file name, are bad input and answered with the failure value.
+ * between, or an update that never ends, leaves the record as it was. Nothing is thrown; null pointers,
+ * and owners and ids that are no plain file name of at most 200 printable bytes, are bad input and
+ * answered with the failure value.
  */
 #ifndef TAVO_TASK_H
 #define TAVO_TASK_H

@@ -353,6 +353,10 @@ std::string QuoteForShell(std::string_view szValue) {
     return Escape(szValue, "$`");
 }
 
+bool IsPathPart(std::string_view szPart) {
+    return !szPart.empty() && szPart != "." && szPart != ".." && szPart.find('/') == std::string_view::npos;
+}
+
 std::string PrintableText(std::string_view szText, size_t nMax) {
     std::string szOut;
     for (const char c : szText) {

@@ -49,6 +49,9 @@ std::string QuoteForShell(std::string_view szValue);
 TAVO_PLATFORM_API std::vector<std::string_view> SplitLines(std::string_view szText);
 TAVO_PLATFORM_API std::string_view Trim(std::string_view szText);
 
+// One step down in a directory tree, and never up or sideways.
+TAVO_PLATFORM_API bool IsPathPart(std::string_view szPart);
+
 // For texts from the network: control characters dropped, cut at nMax bytes.
 TAVO_PLATFORM_API std::string PrintableText(std::string_view szText, size_t nMax);
 

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "core/Border.h"
+#include "core/TextFile.h"
 #include "portforward/ConfList.h"
 
 struct tag_TAVO_ROUTER_SCRIPT {
@@ -31,15 +32,11 @@ constexpr int kLocationSize = 1024;
 constexpr int kVersionSize = 1024;
 
 using tavo::AtBorder;
+using tavo::IsPathPart;
 
 int Fail(int nErr, int nLine) {
     TLIBCErrSet(nErr, kFile, nLine);
     return -1;
-}
-
-// One step down in the database, and never up or sideways.
-bool IsPathPart(const std::string& szPart) {
-    return !szPart.empty() && szPart != "." && szPart != ".." && szPart.find('/') == std::string::npos;
 }
 
 std::vector<std::string> Directories(const fs::path& dir) {
