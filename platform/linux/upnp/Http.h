@@ -8,6 +8,8 @@
 #include <string>
 #include <vector>
 
+#include "core/Export.h"
+
 namespace tavo {
 
 // An http URL taken apart; nothing for another scheme, an unreadable URL or one with an account in it.
@@ -17,7 +19,7 @@ struct HttpUrl {
     std::string szPath;  // begins with "/"
     std::string Text() const { return "http://" + szHost + ":" + std::to_string(nPort) + szPath; }
 };
-std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl);
+TAVO_PLATFORM_API std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl);
 
 enum class HttpEnd { kAnswered, kTimeout, kUnreachable, kGarbage };
 
@@ -28,7 +30,7 @@ struct HttpAnswer {
 };
 
 // One client keeps its connection open between requests where the router does.
-class HttpClient {
+class TAVO_PLATFORM_API HttpClient {
 public:
     HttpClient();
     ~HttpClient();

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 
+#include "core/Export.h"
 #include "upnp/Http.h"
 #include "upnp/Router.h"
 
@@ -18,12 +19,12 @@ struct IgdService {
     HttpUrl control;
 };
 // Nothing when the description is unreadable, offers none, or sends us to another host.
-std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
+TAVO_PLATFORM_API std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
 
 // The error code of a SOAP answer (0 for none), or kRouterGarbage.
-int SoapCode(long nHttpCode, const std::string& szXml);
+TAVO_PLATFORM_API int SoapCode(long nHttpCode, const std::string& szXml);
 
-class Igd : public Router {
+class TAVO_PLATFORM_API Igd : public Router {
 public:
     // The IGD at the gateway: pLocation (may be null) is tried first and set to what worked.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,

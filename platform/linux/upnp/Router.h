@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "core/Export.h"
+
 namespace tavo {
 
 struct RouterMapping {
@@ -31,7 +33,7 @@ enum RouterCode : int {
     kRouterOnlyPermanentLeases = 725
 };
 
-class Router {
+class TAVO_PLATFORM_API Router {
 public:
     virtual ~Router() = default;
     // Outputs are set only with kRouterOk.

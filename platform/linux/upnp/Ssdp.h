@@ -8,12 +8,14 @@
 #include <string>
 #include <string_view>
 
+#include "core/Export.h"
 #include "upnp/Http.h"
 
 namespace tavo {
 
 // The LOCATION of one SSDP answer, when it is http on szGateway; otherwise nothing, and szReason says why.
-std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& szGateway, std::string& szReason);
+TAVO_PLATFORM_API std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& szGateway,
+                                                    std::string& szReason);
 
 // Asks by unicast and by multicast at once, and hands every new location to fnTry until it answers
 // true. False when none did within nLimitMilliseconds.
