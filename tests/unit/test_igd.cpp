@@ -58,6 +58,39 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_FALSE(tavo::ParseDescription("", location));
 }
 
+TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
+    const auto fnModel = [](const std::string& szDevice) {
+        const std::string szXml = "<u:root xmlns:u='x'><u:device>" + szDevice +
+                                  "<deviceList><device><manufacturer>inner</manufacturer><modelName>inner</modelName>"
+                                  "<serviceList><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
+                                  "</serviceType><controlURL>/c</controlURL></service></serviceList></device>"
+                                  "</deviceList></u:device></u:root>";
+        const auto service = tavo::ParseDescription(szXml, {"192.168.1.1", 80, "/"});
+        return service ? service->model.szBrand + "|" + service->model.szModel + "|" + service->model.szVersion : "-";
+    };
+    const std::string szNumber = "<modelNumber>1</modelNumber>";
+    const std::pair<std::string, std::string> rgCases[] = {
+        {"<manufacturer> A &amp; B </manufacturer><modelName>M</modelName>" + szNumber, "A & B|M|1"},
+        {"<u:manufacturer>A</u:manufacturer><u:modelName>M</u:modelName>" + szNumber, "A|M|1"},
+        {szNumber + "<softwareVersion>v2</softwareVersion>", "||v2"},
+        {"<firmwareVersion> </firmwareVersion>" + szNumber, "||1"},
+        {"", "||"},
+        {"<manufacturer><b>A</b></manufacturer>", "||"},
+        {"<manufacturer>x\"; [192.168.1.1]\r\n&#10;&#x1b;user=\"me\t</manufacturer>", "x\"; [192.168.1.1]user=\"me||"}};
+    for (const auto& [szDevice, szExpected] : rgCases) {
+        EXPECT_EQ(fnModel(szDevice), szExpected) << szDevice;
+    }
+    const auto fnBrand = [&](const std::string& szBrand) {
+        return fnModel("<manufacturer>" + szBrand + "</manufacturer>");
+    };
+    const std::string szLong(10000, '"');
+    EXPECT_EQ(fnBrand(szLong).size(), tavo::kMaxModelText + 2);
+    EXPECT_EQ(fnBrand(szLong), fnBrand(szLong));
+    EXPECT_NE(fnBrand(szLong), fnBrand(szLong + "x"));  // the difference lies behind the cut
+    EXPECT_EQ(fnBrand(std::string(tavo::kMaxModelText, 'x')), std::string(tavo::kMaxModelText, 'x') + "||");
+    EXPECT_EQ(fnBrand(std::string(53, 'x') + "\xc3\xa4" + szLong).find("\xc3"), std::string::npos);  // no half letter
+}
+
 TEST(Igd, AnswersThatAreNoneAreGarbage) {
     EXPECT_EQ(tavo::SoapCode(200, "<e><Body><r/></Body></e>"), tavo::kRouterOk);
     EXPECT_EQ(tavo::SoapCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);

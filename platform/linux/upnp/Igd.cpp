@@ -47,6 +47,41 @@ const XMLElement* FindElement(const XMLElement* pElement, std::string_view szNam
     return nullptr;
 }
 
+// A mark of a text that is too long to be kept (32-bit FNV-1a).
+std::string MarkOf(std::string_view szText) {
+    uint32_t nHash = 2166136261U;
+    for (const char c : szText) {
+        nHash = (nHash ^ static_cast<unsigned char>(c)) * 16777619U;
+    }
+    char szMark[16];
+    std::snprintf(szMark, sizeof(szMark), "~%08x", nHash);
+    return szMark;
+}
+
+bool IsInsideCharacter(char c) {
+    return (static_cast<unsigned char>(c) & 0xC0U) == 0x80U;
+}
+
+// One text of what the router says it is.
+std::string ModelText(const XMLElement* pDevice, std::string_view szName) {
+    const XMLElement* pElement = pDevice->FirstChildElement();
+    while (pElement != nullptr && LocalName(*pElement) != szName) {
+        pElement = pElement->NextSiblingElement();
+    }
+    const char* szRaw = pElement == nullptr ? nullptr : pElement->GetText();
+    std::string szText(szRaw == nullptr ? "" : szRaw);
+    szText = Trim(PrintableText(szText, szText.size()));
+    if (szText.size() > kMaxModelText) {
+        const std::string szMark = MarkOf(szText);
+        size_t nKeep = kMaxModelText - szMark.size();
+        while (nKeep > 0 && IsInsideCharacter(szText[nKeep])) {
+            --nKeep;
+        }
+        szText = szText.substr(0, nKeep) + szMark;
+    }
+    return szText;
+}
+
 std::string TextOf(const XMLElement* pElement) {
     const char* szText = pElement == nullptr ? nullptr : pElement->GetText();
     return szText == nullptr ? "" : PrintableText(Trim(szText), kMaxText);
@@ -75,6 +110,21 @@ const XMLElement* FindService(const XMLElement* pElement, int nDepth = 0) {
         }
     }
     return nullptr;
+}
+
+IgdModel ReadModel(const XMLElement* pRoot) {
+    const XMLElement* pDevice = FindElement(pRoot, "device");
+    if (pDevice == nullptr) {
+        return {};
+    }
+    IgdModel model{ModelText(pDevice, "manufacturer"), ModelText(pDevice, "modelName"), ""};
+    // The first two are no standard elements; the routers that have them keep the number for the model.
+    for (const char* szName : {"firmwareVersion", "softwareVersion", "modelNumber"}) {
+        if (model.szVersion.empty()) {
+            model.szVersion = ModelText(pDevice, szName);
+        }
+    }
+    return model;
 }
 
 // The control address, whole or relative to the description; never on another host.
@@ -176,7 +226,7 @@ std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpU
     if (!control) {
         return std::nullopt;
     }
-    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control};
+    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control, ReadModel(document.RootElement())};
 }
 
 int SoapCode(long nHttpCode, const std::string& szXml) {
@@ -192,7 +242,7 @@ int SoapCode(long nHttpCode, const std::string& szXml) {
 }
 
 std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                               std::string* pSzLocation) {
+                               std::string* pSzLocation, int nLocalPort) {
     std::unique_ptr<Igd> pFound;
     HttpClient http;
     const auto fnTry = [&](const HttpUrl& location) {
@@ -216,7 +266,7 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
             return pFound;
         }
     }
-    SearchGateway(szGateway, szLocal, nLimitMilliseconds, fnTry);
+    SearchGateway(szGateway, szLocal, nLimitMilliseconds, nLocalPort, fnTry);
     return pFound;
 }
 
@@ -237,6 +287,39 @@ int Igd::Call(const char* szAction, const std::vector<Argument>& rgArguments, st
     return CodeOf(answer);
 }
 
+int Igd::GetAt(int nIndex, RouterMapping& mapping) {
+    std::string szAnswer;
+    const int nCode = Call("GetGenericPortMappingEntry", {{"NewPortMappingIndex", std::to_string(nIndex)}}, szAnswer);
+    if (nCode != kRouterOk) {
+        return nCode;
+    }
+    XMLDocument document;
+    RouterMapping read;
+    document.Parse(szAnswer.data(), szAnswer.size());
+    if (!ReadKey(document.RootElement(), read) || !ReadEntry(document.RootElement(), read)) {
+        read = {};
+        read.blEnabled = false;
+    }
+    mapping = std::move(read);
+    return kRouterOk;
+}
+
+int Igd::ExternalAddress(std::string& szAddress) {
+    std::string szAnswer;
+    const int nCode = Call("GetExternalIPAddress", {}, szAnswer);
+    if (nCode != kRouterOk) {
+        return nCode;
+    }
+    XMLDocument document;
+    document.Parse(szAnswer.data(), szAnswer.size());
+    const std::string szRead = TextOf(FindElement(document.RootElement(), "NewExternalIPAddress"));
+    if (!IsAddress(szRead)) {
+        return kRouterGarbage;
+    }
+    szAddress = szRead;
+    return kRouterOk;
+}
+
 int Igd::List(std::vector<RouterMapping>& rgMappings) {
     const auto end = std::chrono::steady_clock::now() + kListLimit;
     std::vector<RouterMapping> rgRead;
@@ -245,8 +328,8 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
         if (std::chrono::steady_clock::now() > end) {
             return kRouterTimeout;
         }
-        std::string szAnswer;
-        const int nCode = Call("GetGenericPortMappingEntry", {{"NewPortMappingIndex", std::to_string(i)}}, szAnswer);
+        RouterMapping mapping;
+        const int nCode = GetAt(i, mapping);
         // The end of the table; some routers say so with the codes for bad arguments or no entry.
         if (nCode == kRouterNoSuchIndex || nCode == kRouterNoSuchEntry || (nCode == kRouterInvalidArgs && i > 0)) {
             break;
@@ -254,10 +337,7 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
         if (nCode != kRouterOk) {
             return nCode;
         }
-        XMLDocument document;
-        RouterMapping mapping;
-        document.Parse(szAnswer.data(), szAnswer.size());
-        if (!ReadKey(document.RootElement(), mapping) || !ReadEntry(document.RootElement(), mapping)) {
+        if (mapping.szProtocol.empty()) {
             continue;
         }
         if (!setSeen.emplace(mapping.szProtocol, mapping.nRouterPort).second) {

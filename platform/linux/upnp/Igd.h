@@ -13,10 +13,20 @@
 
 namespace tavo {
 
+// What a router says it is, in its root device. A text that is too long keeps its beginning and gets a
+// mark of the whole at its end, so that two routers never become one.
+struct IgdModel {
+    std::string szBrand;
+    std::string szModel;
+    std::string szVersion;  // the firmware's where the router gives one, else the model number
+};
+inline constexpr size_t kMaxModelText = 63;
+
 // The service of a device description that maps ports.
 struct IgdService {
     std::string szType;
     HttpUrl control;
+    IgdModel model;
 };
 // Nothing when the description is unreadable, offers none, or sends us to another host.
 TAVO_PLATFORM_API std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
@@ -26,10 +36,15 @@ TAVO_PLATFORM_API int SoapCode(long nHttpCode, const std::string& szXml);
 
 class TAVO_PLATFORM_API Igd : public Router {
 public:
-    // The IGD at the gateway: pLocation (may be null) is tried first and set to what worked.
+    // The IGD at the gateway: pSzLocation (may be null) is tried first and set to what worked. A search
+    // lasts as SearchGateway says.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                                     std::string* pSzLocation);
+                                     std::string* pSzLocation, int nLocalPort = 0);
 
+    // The entry at an index. One that makes no sense comes back disabled and without a protocol.
+    int GetAt(int nIndex, RouterMapping& mapping);
+    // The router's address on its other side, as it says itself.
+    int ExternalAddress(std::string& szAddress);
     int List(std::vector<RouterMapping>& rgMappings) override;
     int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override;
     int Add(const RouterMapping& mapping) override;

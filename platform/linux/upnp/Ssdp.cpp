@@ -29,6 +29,7 @@ constexpr size_t kMaxReason = 200;
 constexpr size_t kMaxLocations = 16;  // a gateway that names more is playing games
 // UDP gets lost: each question is asked again at these times after the first.
 constexpr int kAskAtMilliseconds[] = {0, 150, 600, 1500, 3000};
+constexpr auto kSilence = std::chrono::milliseconds(3000);
 constexpr const char* kTargets[] = {
     "urn:schemas-upnp-org:device:InternetGatewayDevice:1", "urn:schemas-upnp-org:device:InternetGatewayDevice:2",
     "urn:schemas-upnp-org:service:WANIPConnection:1", "urn:schemas-upnp-org:service:WANPPPConnection:1"};
@@ -56,10 +57,14 @@ void Ask(int fd, const std::string& szGateway) {
     }
 }
 
-Descriptor OpenSocket(const std::string& szLocal) {
+bool Bind(int fd, const sockaddr_in& local) {
+    return bind(fd, reinterpret_cast<const sockaddr*>(&local), sizeof(local)) == 0;
+}
+
+Descriptor OpenSocket(const std::string& szLocal, int nLocalPort) {
     Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-    const sockaddr_in local = Address(szLocal.c_str(), 0);
-    if (fd.Get() < 0 || bind(fd.Get(), reinterpret_cast<const sockaddr*>(&local), sizeof(local)) != 0) {
+    const sockaddr_in local = Address(szLocal.c_str(), static_cast<uint16_t>(nLocalPort));
+    if (fd.Get() < 0 || (!Bind(fd.Get(), local) && !Bind(fd.Get(), Address(szLocal.c_str(), 0)))) {
         return Descriptor();
     }
     setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &local.sin_addr, sizeof(local.sin_addr));
@@ -77,8 +82,8 @@ bool IsAddressForDevices(const std::string& szHost) {
     return !blLoopback && !blLinkLocal && nHost != 0;
 }
 
-// Where one answer from the gateway points; refusals are logged.
-std::optional<HttpUrl> Receive(int fd, const std::string& szGateway) {
+// Where one answer from the gateway points; refusals are logged. blHeard: it said something at all.
+std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHeard) {
     char szAnswer[kMaxAnswer];
     sockaddr_in from = {};
     socklen_t nLength = sizeof(from);
@@ -86,6 +91,7 @@ std::optional<HttpUrl> Receive(int fd, const std::string& szGateway) {
     if (nRead <= 0 || from.sin_addr.s_addr != Address(szGateway.c_str(), 0).sin_addr.s_addr) {
         return std::nullopt;  // another device on the network: not our router
     }
+    blHeard = true;
     std::string szReason;
     auto location = LocationOf({szAnswer, static_cast<size_t>(nRead)}, szGateway, szReason);
     if (!location) {
@@ -123,14 +129,16 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
     return std::nullopt;
 }
 
-bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
+bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
                    const std::function<bool(const HttpUrl&)>& fnTry) {
-    const Descriptor fd = OpenSocket(szLocal);
+    const Descriptor fd = OpenSocket(szLocal, nLocalPort);
     if (fd.Get() < 0) {
         return false;
     }
     const Clock::time_point start = Clock::now();
-    const Clock::time_point end = start + std::chrono::milliseconds(nLimitMilliseconds);
+    const Clock::time_point limit = start + std::chrono::milliseconds(nLimitMilliseconds);
+    Clock::time_point end =
+        std::min(limit, start + std::chrono::milliseconds(*std::rbegin(kAskAtMilliseconds)) + kSilence);
     std::set<std::string> setSeen;
     size_t nAsked = 0;
     while (Clock::now() < end && setSeen.size() < kMaxLocations) {
@@ -147,9 +155,13 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
         if (poll(&waiting, 1, MillisecondsUntil(wake) + 1) <= 0) {
             continue;
         }
-        const std::optional<HttpUrl> location = Receive(fd.Get(), szGateway);
+        bool blHeard = false;
+        const std::optional<HttpUrl> location = Receive(fd.Get(), szGateway, blHeard);
         if (location && setSeen.insert(location->Text()).second && fnTry(*location)) {
             return true;
+        }
+        if (blHeard) {
+            end = std::min(limit, std::max(end, Clock::now() + kSilence));
         }
     }
     return false;

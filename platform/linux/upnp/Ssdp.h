@@ -18,8 +18,11 @@ TAVO_PLATFORM_API std::optional<HttpUrl> LocationOf(std::string_view szAnswer, c
                                                     std::string& szReason);
 
 // Asks by unicast and by multicast at once, and hands every new location to fnTry until it answers
-// true. False when none did within nLimitMilliseconds.
-bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
+// true. False when none did within nLimitMilliseconds, and before that when the gateway has been silent
+// for three seconds after the last question: it had three times what the question allows for the answer,
+// and a box without a UPnP router is not made to wait. Asks from the local port nLocalPort, from any
+// other when that one is taken or 0.
+bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
                    const std::function<bool(const HttpUrl&)>& fnTry);
 
 }  // namespace tavo

@@ -17,7 +17,7 @@ constexpr int kFirstPort = 20000;
 constexpr int kMostPorts = 1000;
 constexpr char kHelp[] =
     "Usage: tavo-igd discover | list | map N | unmap\n"
-    "  discover  where the gateway's port-mapping service is\n"
+    "  discover  where the gateway's port-mapping service is, and what the router calls itself\n"
     "  list      the router's table\n"
     "  map N     make the tool's mappings TCP 20000 and up, N of them (1 to 1000), the only ones with our mark\n"
     "  unmap     take every mapping with our mark away\n";
@@ -87,7 +87,10 @@ int main(int argc, char** argv) {
     const Clock::time_point work = Clock::now();
     int nStatus = 0;
     if (szVerb == "discover") {
-        std::printf("%s at %s\n", pIgd->Service().szType.c_str(), pIgd->Service().control.Text().c_str());
+        const tavo::IgdService& service = pIgd->Service();
+        std::printf("%s at %s\n", service.szType.c_str(), service.control.Text().c_str());
+        std::printf("brand '%s' model '%s' version '%s'\n", service.model.szBrand.c_str(),
+                    service.model.szModel.c_str(), service.model.szVersion.c_str());
     } else if (szVerb == "list") {
         nStatus = List(*pIgd);
     } else {

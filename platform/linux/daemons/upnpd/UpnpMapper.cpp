@@ -2,7 +2,6 @@
 // the platform's addresses. Promises: see UpnpMapper.h.
 #include "daemons/upnpd/UpnpMapper.h"
 
-#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -12,6 +11,7 @@
 #include "core/TextFile.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
+#include "upnp/Known.h"
 
 namespace tavo {
 
@@ -19,24 +19,16 @@ namespace {
 
 constexpr char kRunKey[] = "runupnpportmapping";
 constexpr char kStatusFile[] = "/var/tmp/upnp_portmap.status";
-constexpr char kStateDir[] = "/var/lib/tavo";
-constexpr char kStateFile[] = "/var/lib/tavo/upnp_igd.conf";
 constexpr mode_t kStatusMode = 0644;
 constexpr int kDiscoveryMilliseconds = 5000;
 constexpr int kFailuresToRediscover = 3;
 constexpr int kRetrySeconds = 10;
 constexpr size_t kAddressSize = 16;
-constexpr int kUrlSize = 1024;
 
 int Setting(const char* szKey, const char* szDefault, int nLeast, int nMost) {
     char szValue[16];
     TLIBPlatformSettingGet("upnpd", szKey, szDefault, szValue, sizeof(szValue));
     return static_cast<int>(std::clamp<long>(std::strtol(szValue, nullptr, 10), nLeast, nMost));
-}
-
-std::string StateOf(const std::string& szGateway, const char* szKey) {
-    char szValue[kUrlSize];
-    return TLIBCFileGetSectionValue(kStateFile, szGateway.c_str(), szKey, szValue, sizeof(szValue)) == 0 ? szValue : "";
 }
 
 }  // namespace
@@ -58,8 +50,9 @@ bool UpnpMapper::FindRouter() {
     if (mSzGateway != szGateway) {
         Forget();
         mSzGateway = szGateway;
-        mSzLocation = StateOf(mSzGateway, "location");
-        mHabit.blPermanentOnly = StateOf(mSzGateway, "permanent") == "yes";
+        KnownRouter known = RecallRouter(mSzGateway);
+        mSzLocation = std::move(known.szLocation);
+        mHabit.blPermanentOnly = known.blPermanentOnly;
     }
     mSzBox = szBox;
     if (mPIgd == nullptr) {
@@ -78,13 +71,7 @@ void UpnpMapper::Forget() {
 
 // What worked is tried first the next time, also after a restart.
 void UpnpMapper::Remember() const {
-    mkdir(kStateDir, 0755);
-    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(2), &TLIBCSzHashFree);
-    TLIBCSzHashSetValue(pHash.get(), "location", mSzLocation.c_str());
-    TLIBCSzHashSetValue(pHash.get(), "permanent", mHabit.blPermanentOnly ? "yes" : "no");
-    if (TLIBCFileAddSection(kStateFile, mSzGateway.c_str(), pHash.get(), 0) != 1) {
-        syslog(LOG_WARNING, "cannot write %s", kStateFile);
-    }
+    KeepRouter(mSzGateway, {mSzLocation, mHabit.blPermanentOnly});
 }
 
 PassResult UpnpMapper::Map(const std::function<bool()>& fnStop) {

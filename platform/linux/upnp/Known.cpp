@@ -1,0 +1,45 @@
+// Keeps what was learnt about each gateway. Relies on the platform's sectioned files.
+// Promises: see Known.h.
+#include "upnp/Known.h"
+
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <memory>
+
+#include "tavo/core.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr char kStateDir[] = "/var/lib/tavo";
+constexpr char kStateFile[] = "/var/lib/tavo/upnp_igd.conf";
+constexpr int kUrlSize = 1024;
+
+std::string StateOf(const std::string& szGateway, const char* szKey) {
+    char szValue[kUrlSize];
+    return TLIBCFileGetSectionValue(kStateFile, szGateway.c_str(), szKey, szValue, sizeof(szValue)) == 0 ? szValue : "";
+}
+
+}  // namespace
+
+KnownRouter RecallRouter(const std::string& szGateway) {
+    return {StateOf(szGateway, "location"), StateOf(szGateway, "permanent") == "yes"};
+}
+
+void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
+    const KnownRouter before = RecallRouter(szGateway);
+    if (before.szLocation == router.szLocation && before.blPermanentOnly == router.blPermanentOnly) {
+        return;
+    }
+    mkdir(kStateDir, 0755);
+    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(2), &TLIBCSzHashFree);
+    TLIBCSzHashSetValue(pHash.get(), "location", router.szLocation.c_str());
+    TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
+    if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
+        syslog(LOG_WARNING, "cannot write %s", kStateFile);
+    }
+}
+
+}  // namespace tavo

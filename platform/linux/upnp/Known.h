@@ -1,0 +1,21 @@
+// What was learnt about a router, kept between runs and shared by upnpd and the client.
+// Relies on a sectioned file below /var/lib/tavo. Promises: a file that is missing or damaged is
+// "nothing known".
+#pragma once
+
+#include <string>
+
+#include "core/Export.h"
+
+namespace tavo {
+
+struct KnownRouter {
+    std::string szLocation;  // where its description was last found
+    bool blPermanentOnly = false;
+};
+
+TAVO_PLATFORM_API KnownRouter RecallRouter(const std::string& szGateway);
+// Writes only what differs from what is there; a failure is logged.
+TAVO_PLATFORM_API void KeepRouter(const std::string& szGateway, const KnownRouter& router);
+
+}  // namespace tavo
