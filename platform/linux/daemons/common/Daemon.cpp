@@ -25,6 +25,17 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
+constexpr char kHelp[] =
+    "Usage: %s [--foreground]\n"
+    "Keeps the %s port mappings of the router in line with /etc/portforward/rule.conf.\n"
+    "\n"
+    "  --foreground  stay attached to the terminal\n"
+    "  --help        this text\n"
+    "\n"
+    "SIGHUP reads the rules again; SIGTERM takes the mappings away and ends.\n"
+    "The results stand in %s, the pid in %s.\n"
+    "It maps only while %s=\"yes\" stands in /etc/tavoinfo.conf.\n";
+constexpr int kExitUsage = 2;
 constexpr char kMarkerDir[] = "/tmp";
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
@@ -109,7 +120,7 @@ Descriptor Detach() {
 
 class Frame {
 public:
-    Frame(const DaemonNames& names, Mapper& mapper) : mNames(names), mMapper(mapper) {
+    explicit Frame(Mapper& mapper) : mNames(mapper.Names()), mMapper(mapper) {
         mFdEvents.Reset(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
         inotify_add_watch(mFdEvents.Get(), kMarkerDir, IN_CREATE | IN_MOVED_TO);
     }
@@ -133,13 +144,16 @@ private:
     Clock::time_point mNext = Clock::now();
 };
 
-// Until the clock, a signal or a new file in the marker's directory.
+// Until the clock, a signal, a new file in the marker's directory or a word from the router.
 void Frame::Wait() {
     const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mNext - Clock::now()).count() + 1;
-    pollfd rgWaiting[] = {{mSignals.Fd(), POLLIN, 0}, {mFdEvents.Get(), POLLIN, 0}};
+    pollfd rgWaiting[] = {{mSignals.Fd(), POLLIN, 0}, {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}};
     poll(rgWaiting, std::size(rgWaiting), static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
     alignas(inotify_event) char szEvents[4096];
     while (read(mFdEvents.Get(), szEvents, sizeof(szEvents)) > 0) {
+    }
+    if (rgWaiting[2].revents != 0 && mMapper.OnWake()) {
+        mNext = Clock::now();
     }
 }
 
@@ -175,9 +189,8 @@ void Frame::Loop() {
     Stop();
 }
 
-}  // namespace
-
-int RunDaemon(const DaemonNames& names, Mapper& mapper, bool blForeground) {
+int RunDaemon(Mapper& mapper, bool blForeground) {
+    const DaemonNames& names = mapper.Names();
     openlog(names.szName, LOG_PID, LOG_DAEMON);
     Descriptor fdReady = blForeground ? Descriptor() : Detach();
     const Descriptor fdLock(open(names.szLockFile, O_RDWR | O_CREAT | O_CLOEXEC, kPrivateMode));
@@ -185,7 +198,7 @@ int RunDaemon(const DaemonNames& names, Mapper& mapper, bool blForeground) {
         syslog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
         return 1;
     }
-    Frame frame(names, mapper);
+    Frame frame(mapper);
     WritePidFile(names);
     if (fdReady.Get() >= 0 && write(fdReady.Get(), "r", 1) != 1) {
         syslog(LOG_WARNING, "nobody waited for the start");
@@ -193,6 +206,30 @@ int RunDaemon(const DaemonNames& names, Mapper& mapper, bool blForeground) {
     fdReady.Reset();
     frame.Loop();
     return 0;
+}
+
+void PrintHelp(FILE* pOut, const DaemonNames& names) {
+    std::fprintf(pOut, kHelp, names.szName, names.szProtocol, names.szResultFile, names.szPidFile, names.szRunKey);
+}
+
+}  // namespace
+
+int DaemonMain(int argc, char** argv, Mapper& mapper) {
+    bool blForeground = false;
+    for (int i = 1; i < argc; ++i) {
+        const std::string szArgument = argv[i];
+        if (szArgument == "--help") {
+            PrintHelp(stdout, mapper.Names());
+            return 0;
+        }
+        if (szArgument != "--foreground") {
+            std::fprintf(stderr, "%s: unknown argument '%s'\n\n", mapper.Names().szName, argv[i]);
+            PrintHelp(stderr, mapper.Names());
+            return kExitUsage;
+        }
+        blForeground = true;
+    }
+    return RunDaemon(mapper, blForeground);
 }
 
 }  // namespace tavo

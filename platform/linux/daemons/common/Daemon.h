@@ -9,9 +9,19 @@
 
 namespace tavo {
 
+struct DaemonNames {
+    const char* szName;      // also its section in the platform's settings
+    const char* szProtocol;  // as a user reads it
+    const char* szRunKey;    // it maps only while this key of /etc/tavoinfo.conf is "yes"
+    const char* szPidFile;
+    const char* szLockFile;
+    const char* szResultFile;  // what became of the newest request
+};
+
 class Mapper {
 public:
     virtual ~Mapper() = default;
+    virtual const DaemonNames& Names() const = 0;
     // One pass: reads the settings anew when blRequested (a start or a SIGHUP, as against the clock),
     // brings the router in line and writes the results. fnStop: whether to end early. Seconds until the
     // next pass.
@@ -20,15 +30,14 @@ public:
     virtual bool IsSwitchedOn() const = 0;
     // Takes away every mapping that we made.
     virtual void Withdraw(const std::function<bool()>& fnStop) = 0;
+    // A descriptor on which the router may speak of its own accord, or -1; and, when it did, whether
+    // what it said is a reason for a pass now.
+    virtual int WakeFd() const { return -1; }
+    virtual bool OnWake() { return false; }
 };
 
-struct DaemonNames {
-    const char* szName;
-    const char* szPidFile;
-    const char* szLockFile;
-};
-
-// Runs until SIGTERM or SIGINT. Exit status: 0, or 1 when another instance runs or nothing could be started.
-int RunDaemon(const DaemonNames& names, Mapper& mapper, bool blForeground);
+// A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM or
+// SIGINT. Exit status: 0; 1 when another instance runs or nothing could be started; 2 for a wrong argument.
+int DaemonMain(int argc, char** argv, Mapper& mapper);
 
 }  // namespace tavo

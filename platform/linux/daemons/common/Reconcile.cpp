@@ -11,9 +11,6 @@ namespace tavo {
 
 namespace {
 
-constexpr auto kPassLimit = std::chrono::seconds(150);  // well below the five minutes that a save waits
-constexpr int kTransportTries = 2;                      // silent answers in a row before a pass gives up
-
 using Key = std::pair<std::string, uint16_t>;
 
 Key KeyOf(const RouterMapping& mapping) {
@@ -23,17 +20,13 @@ Key KeyOf(const RouterMapping& mapping) {
 class Pass {
 public:
     Pass(Router& router, const std::string& szBox, LeaseHabit& habit, bool blRenew, const std::function<bool()>& fnStop)
-        : mRouter(router),
-          mSzBox(szBox),
-          mHabit(habit),
-          mBlRenew(blRenew),
-          mFnStop(fnStop),
-          mEnd(std::chrono::steady_clock::now() + kPassLimit) {}
+        : mRouter(router), mSzBox(szBox), mHabit(habit), mBlRenew(blRenew), mGuard(mResult, fnStop) {}
 
     PassResult Run(const std::vector<RouterMapping>& rgWanted);
 
 private:
-    bool IsOver();
+    bool IsOver() { return mGuard.IsOver(); }
+    int Note(int nCode) { return mGuard.Note(nCode); }
     bool IsOwn(const RouterMapping& mapping) const {
         return mapping.szClient == mSzBox && mapping.szDescription.starts_with(kOwnPrefix);
     }
@@ -47,35 +40,15 @@ private:
     std::string ReadBack(const RouterMapping& wanted);
     std::string AfterConflict(const RouterMapping& wanted);
     void NoteLease(uint32_t nLease);
-    int Note(int nCode);
 
     Router& mRouter;
     const std::string& mSzBox;
     LeaseHabit& mHabit;
     bool mBlRenew;
-    const std::function<bool()>& mFnStop;
-    std::chrono::steady_clock::time_point mEnd;
     std::map<Key, RouterMapping> mMapTable;
     PassResult mResult;
-    int mNSilent = 0;
+    PassGuard mGuard;
 };
-
-bool Pass::IsOver() {
-    mResult.blStopped = mResult.blStopped || mFnStop();
-    if (std::chrono::steady_clock::now() > mEnd && mResult.nTransport == kRouterOk) {
-        mResult.nTransport = kRouterTimeout;
-    }
-    return mResult.blStopped || mResult.nTransport != kRouterOk;
-}
-
-// Counts answers that did not come; after a few in a row the pass is over.
-int Pass::Note(int nCode) {
-    mNSilent = nCode < 0 ? mNSilent + 1 : 0;
-    if (mNSilent >= kTransportTries || nCode == kRouterUnreachable) {
-        mResult.nTransport = nCode;
-    }
-    return nCode;
-}
 
 void Pass::NoteLease(uint32_t nLease) {
     if (nLease != 0 && (mResult.nShortestLease == 0 || nLease < mResult.nShortestLease)) {

@@ -3,12 +3,11 @@
 // only when the router showed it; ends soon after fnStop answers true or the deadline has passed.
 #pragma once
 
-#include <chrono>
 #include <functional>
 #include <string>
-#include <utility>
 #include <vector>
 
+#include "daemons/common/Pass.h"
 #include "upnp/Router.h"
 
 namespace tavo {
@@ -17,13 +16,6 @@ namespace tavo {
 struct LeaseHabit {
     uint32_t nLease = 3600;        // seconds to ask for
     bool blPermanentOnly = false;  // it refuses leases
-};
-
-struct PassResult {
-    std::vector<std::pair<std::string, std::string>> rgStatus;  // mapping name, "1" or the code or word of failure
-    uint32_t nShortestLease = 0;                                // seconds granted; 0: all permanent
-    int nTransport = kRouterOk;                                 // below 0: why the router could not be spoken to
-    bool blStopped = false;
 };
 
 // rgWanted: with client addresses unset; szBox: the box's own address. blRenew: leases are due.

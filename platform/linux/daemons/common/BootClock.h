@@ -1,0 +1,24 @@
+// A clock that never jumps and goes on while the box sleeps, as a router's leases do.
+// Relies on CLOCK_BOOTTIME. Promises: never goes backwards.
+#pragma once
+
+#include <chrono>
+#include <ctime>
+
+namespace tavo {
+
+struct BootClock {
+    using rep = std::chrono::nanoseconds::rep;
+    using period = std::chrono::nanoseconds::period;
+    using duration = std::chrono::nanoseconds;
+    using time_point = std::chrono::time_point<BootClock>;
+    static constexpr bool is_steady = true;
+
+    static time_point now() {
+        timespec time = {};
+        clock_gettime(CLOCK_BOOTTIME, &time);
+        return time_point(std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec));
+    }
+};
+
+}  // namespace tavo

@@ -1,0 +1,155 @@
+// The common mapping side of the daemons. Relies on Wanted, RouterTurn and the platform's addresses.
+// Promises: see RuleMapper.h.
+#include "daemons/common/RuleMapper.h"
+
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+
+#include "core/TextFile.h"
+#include "tavo/core.h"
+#include "tavo/net.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr mode_t kResultMode = 0644;
+constexpr int kFailuresToRediscover = 3;
+constexpr int kRetrySeconds = 10;
+constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
+constexpr size_t kAddressSize = 16;
+
+int Setting(const char* szSection, const char* szKey, const char* szDefault, int nLeast, int nMost) {
+    char szValue[16];
+    TLIBPlatformSettingGet(szSection, szKey, szDefault, szValue, sizeof(szValue));
+    return static_cast<int>(std::clamp<long>(std::strtol(szValue, nullptr, 10), nLeast, nMost));
+}
+
+}  // namespace
+
+RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
+    : mNames(names),
+      mBlRequestRenews(blRequestRenews),
+      mNCheckSeconds(Setting(names.szName, "check_interval", "120", 1, 3600)),
+      mNWishedLease(static_cast<uint32_t>(Setting(names.szName, "lease", "3600", 20, 604800))) {}
+
+void RuleMapper::ReadRules() {
+    unlink(mNames.szResultFile);  // what it says belongs to an older request
+    WantedSet wanted = ReadWanted(mNames.szRunKey);
+    if (wanted.blReadable) {
+        mWanted = std::move(wanted);
+    } else {
+        mWanted.blReadable = false;
+        syslog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
+    }
+}
+
+// False: there is no gateway. A gateway or an own address that has changed makes all begin anew.
+bool RuleMapper::FindGateway() {
+    char szGateway[kAddressSize] = {};
+    char szBox[kAddressSize] = {};
+    const bool blFound = TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) == 0 &&
+                         TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) == 0;
+    if (!blFound) {
+        szGateway[0] = '\0';
+    }
+    if (mSzGateway != szGateway || mSzBox != szBox) {
+        mSzGateway = szGateway;
+        mSzBox = szBox;
+        mNLease = 0;
+        NewGateway();
+    }
+    return blFound;
+}
+
+// A daemon that is switched off and does not have the turn has nothing at the router to take away: it
+// gave the turn back only after that.
+bool RuleMapper::TakeTurn(const std::function<bool()>& fnStop) {
+    const auto end = BootClock::now() + kTurnLimit;
+    return mTurn.Take([&] { return IsSwitchedOn() && !fnStop() && BootClock::now() < end; });
+}
+
+PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord) {
+    PassResult result;
+    for (const RouterMapping& wanted : rgWanted) {
+        result.rgStatus.emplace_back(MappingName(wanted), szWord);
+    }
+    result.nTransport = kRouterUnreachable;
+    return result;
+}
+
+PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnStop) {
+    if (!TakeTurn(fnStop)) {
+        PassResult result = Failed(mWanted.rgMappings, "busy");
+        result.nTransport = IsSwitchedOn() ? kRouterTimeout : kRouterOk;
+        result.blStopped = fnStop();
+        return result;
+    }
+    if (!FindGateway()) {
+        return Failed(mWanted.rgMappings, "nogateway");
+    }
+    const auto now = BootClock::now();
+    const bool blDue = mNLease != 0 && now - mRenewed >= std::chrono::seconds(mNLease / 2);
+    const bool blRenew = blDue || (blRequested && mBlRequestRenews);
+    PassResult result = Map(mWanted.rgMappings, blRenew, fnStop);
+    if (result.nTransport == kRouterOk && !result.blStopped) {
+        mRenewed = blRenew || result.blRenewed || mNLease == 0 ? now : mRenewed;
+        mNLease = result.nShortestLease;
+    }
+    return result;
+}
+
+int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
+    if (blRequested) {
+        ReadRules();
+    }
+    const PassResult result = Pass(blRequested, fnStop);
+    if (!result.blStopped) {
+        WriteResults(result);
+        if (!IsSwitchedOn()) {
+            mTurn.GiveBack();
+        }
+    }
+    return SecondsToNext(result);
+}
+
+int RuleMapper::SecondsToNext(const PassResult& result) {
+    if (result.nTransport != kRouterOk) {
+        if (++mNFailures >= kFailuresToRediscover) {
+            mNFailures = 0;
+            mNLease = 0;
+            LostRouter();
+        }
+        return std::min(mNCheckSeconds, kRetrySeconds);
+    }
+    mNFailures = 0;
+    if (mNLease == 0) {
+        return mNCheckSeconds;
+    }
+    const auto left = mRenewed + std::chrono::seconds(mNLease / 2) - BootClock::now();
+    const auto nLeft = std::chrono::ceil<std::chrono::seconds>(left).count();
+    return static_cast<int>(std::clamp<int64_t>(nLeft, 1, mNCheckSeconds));
+}
+
+void RuleMapper::WriteResults(PassResult result) const {
+    for (const std::string& szRule : mWanted.rgszInvalid) {
+        result.rgStatus.emplace_back(szRule, "invalid");
+    }
+    if (!mWanted.blReadable) {
+        result.rgStatus.emplace_back("rule.conf", "unreadable");
+    }
+    if (!WriteFileAtomic(mNames.szResultFile, ResultText(result.rgStatus), kResultMode)) {
+        syslog(LOG_ERR, "cannot write %s", mNames.szResultFile);
+    }
+}
+
+void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
+    if (mTurn.Take([] { return false; }) && FindGateway()) {
+        Map({}, false, fnStop);
+    }
+}
+
+}  // namespace tavo

@@ -1,0 +1,71 @@
+// What the mapping side of both daemons does alike: rules, results, the gateway and the box's address, the
+// clock of checks, renewals and retries. Relies on the settings, the rule file and the platform's addresses;
+// the protocol is spoken by the class derived from it.
+// Promises: the result file is removed when a request begins and complete when its pass has ended; the
+// router is spoken to only while the other daemon does not.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "daemons/common/BootClock.h"
+#include "daemons/common/Daemon.h"
+#include "daemons/common/Reconcile.h"
+#include "daemons/common/RouterTurn.h"
+#include "daemons/common/Wanted.h"
+
+namespace tavo {
+
+class RuleMapper : public Mapper {
+public:
+    const DaemonNames& Names() const final { return mNames; }
+    int Run(bool blRequested, const std::function<bool()>& fnStop) final;
+    bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
+    void Withdraw(const std::function<bool()>& fnStop) final;
+
+protected:
+    // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked
+    // what it has.
+    RuleMapper(const DaemonNames& names, bool blRequestRenews);
+
+    // Brings the router in line. blRenew: leases are due.
+    virtual PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+                           const std::function<bool()>& fnStop) = 0;
+    // The result file's text, of names and words of all that was asked for; "1" is success.
+    virtual std::string ResultText(const StatusList& rgStatus) const = 0;
+    // The gateway or the box's own address is another one: nothing of what was known holds.
+    virtual void NewGateway() = 0;
+    // Several passes in a row have failed.
+    virtual void LostRouter() {}
+
+    // What a pass that failed as a whole says of each mapping.
+    static PassResult Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord);
+
+    const std::string& Gateway() const { return mSzGateway; }
+    const std::string& Box() const { return mSzBox; }
+    uint32_t WishedLease() const { return mNWishedLease; }
+
+private:
+    void ReadRules();
+    bool FindGateway();
+    bool TakeTurn(const std::function<bool()>& fnStop);
+    PassResult Pass(bool blRequested, const std::function<bool()>& fnStop);
+    void WriteResults(PassResult result) const;
+    int SecondsToNext(const PassResult& result);
+
+    const DaemonNames& mNames;
+    bool mBlRequestRenews;
+    int mNCheckSeconds;
+    uint32_t mNWishedLease;
+    WantedSet mWanted;
+    RouterTurn mTurn;
+    std::string mSzGateway;
+    std::string mSzBox;
+    int mNFailures = 0;
+    uint32_t mNLease = 0;  // seconds that the router grants
+    BootClock::time_point mRenewed;
+};
+
+}  // namespace tavo
