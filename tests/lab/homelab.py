@@ -7,9 +7,13 @@ router with faults. Every wait polls to a deadline; every process started here i
 import json
 import os
 import re
+import shutil
 import signal
 import subprocess
+import sys
 import time
+import unittest
+from xml.sax.saxutils import escape
 
 BUILD = os.environ["TAVO_BUILD_DIR"]
 HERE = os.path.dirname(os.path.abspath(__file__))
@@ -39,6 +43,36 @@ table inet home {
     jump miniupnpd
   }
 }
+"""
+
+AVAHI = "/usr/sbin/avahi-daemon --no-drop-root --no-chroot --no-rlimits --no-proc-title"
+AVAHI_CONF = """
+[server]
+host-name={name}
+use-ipv6=no
+enable-dbus={dbus}
+[publish]
+publish-workstation=no
+"""
+AIRPORT_SERVICE = """<?xml version="1.0" standalone="no"?><!DOCTYPE service-group SYSTEM "avahi-service.dtd">
+<service-group><name>{name}</name><service><type>_airport._tcp</type><port>5009</port></service></service-group>
+"""
+# What an init script of avahi does, for a place where nobody else looks after services.
+AVAHI_INIT = f"""#!/bin/sh
+case $1 in restart|stop)
+    {AVAHI} --check && {AVAHI} --kill
+    while {AVAHI} --check; do sleep 0.02; done ;;
+esac
+case $1 in restart|start) {AVAHI} --daemonize -f /etc/avahi/box.conf ;; esac
+"""
+BUS = "/run/dbus/system_bus_socket"
+DBUS_CONF = f"""<busconfig>
+  <type>system</type>
+  <listen>unix:path={BUS}</listen>
+  <auth>EXTERNAL</auth>
+  <policy context="default"><allow user="*"/><allow own="*"/><allow send_destination="*"/>
+    <allow receive_sender="*"/></policy>
+</busconfig>
 """
 
 
@@ -82,7 +116,8 @@ class Lab:
         for directory in ("/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/sbin",
                           "/usr/tavo/bin", "/etc/tavo"):
             os.makedirs(directory, exist_ok=True)
-        for source, target in (("platform/linux/daemons/upnpd", "/usr/tavo/sbin/upnpd"), ):
+        for source, target in (("platform/linux/daemons/upnpd", "/usr/tavo/sbin/upnpd"),
+                               ("platform/linux/daemons/tavoairportd", "/usr/tavo/sbin/tavoairportd")):
             if os.path.lexists(target):
                 os.unlink(target)
             os.symlink(f"{BUILD}/{source}", target)
@@ -182,6 +217,52 @@ class Lab:
     def map_foreign(self, port, protocol="TCP"):
         self.run("lan2", f"upnpc -a {LAN2} {port} {port} {protocol}")
 
+    # ---- avahi ------------------------------------------------------------------------------------------
+
+    def prepare_avahi(self):
+        """The sandbox has no user but root, to whom avahi can give its directory."""
+        for path, ids in (("/etc/passwd", "0:0"), ("/etc/group", "0")):
+            self.write(path, re.sub(r"(?m)^avahi:x:[\d:]+?:(?=\D|$)", f"avahi:x:{ids}:", self.read(path)))
+        os.makedirs("/run/avahi-daemon", exist_ok=True)
+
+    def start_avahi(self):
+        """D-Bus, avahi with its init script, and the publisher of base stations, all on the box."""
+        self.prepare_avahi()
+        self.write("/etc/init.d/avahi-daemon", AVAHI_INIT)
+        os.chmod("/etc/init.d/avahi-daemon", 0o755)
+        self.write("/etc/avahi/box.conf", AVAHI_CONF.format(name="box", dbus="yes"))
+        bus = self.start_bus()
+        self.restart_avahi()
+        return bus, self.start("box", "/usr/tavo/sbin/tavoairportd")
+
+    def start_bus(self):
+        self.write("/tmp/dbus.conf", DBUS_CONF)
+        os.makedirs("/run/dbus", exist_ok=True)
+        if os.path.exists(BUS):
+            os.unlink(BUS)
+        bus = self.start("box", "/usr/bin/dbus-daemon", "--config-file=/tmp/dbus.conf", "--nofork", "--nopidfile",
+                         stderr=subprocess.DEVNULL)
+        wait_for(lambda: os.path.exists(BUS), 10, "the bus is up")
+        return bus
+
+    def restart_avahi(self, verb="restart"):
+        self.run("box", f"/etc/init.d/avahi-daemon {verb}")
+
+    def publish_airport(self, host, *names):
+        """An AirPort base station: announces one service for each name from the host's own address, until
+        the process returned is ended (terminate: with a goodbye; kill: without)."""
+        self.prepare_avahi()
+        directory = f"/tmp/airport.{host}"
+        shutil.rmtree(directory, ignore_errors=True)
+        os.makedirs(directory)
+        for number, name in enumerate(names):
+            self.write(f"{directory}/{number}.service", AIRPORT_SERVICE.format(name=escape(name)))
+        self.write(f"/etc/avahi/{host}.conf", AVAHI_CONF.format(name=f"station-{host}", dbus="no"))
+        # Two avahi daemons share the paths of this machine: this one gets its own places over them.
+        return self.start(host, "/bin/sh", "-c", "mount -t tmpfs tmpfs /run/avahi-daemon && "
+                          f"mount --bind {directory} /etc/avahi/services && "
+                          f"exec {AVAHI} -f /etc/avahi/{host}.conf", stderr=subprocess.DEVNULL)
+
     # ---- connections ----------------------------------------------------------------------------------
 
     def serve(self, *ports):
@@ -223,3 +304,15 @@ def in_lab(main):
         return main(lab)
     finally:
         lab.close()
+
+
+def run_tests(tests):
+    """Runs the cases of the calling file, each as tests(lab) prepares them, and prints a summary."""
+    def main(lab):
+        tests(lab)
+        result = unittest.main(exit=False, verbosity=2, warnings="ignore").result
+        failed = min(result.testsRun, len(result.failures) + len(result.errors))
+        print(f"{result.testsRun - failed} passed, {failed} failed")
+        return 1 if failed or not result.testsRun else 0
+
+    sys.exit(in_lab(main))

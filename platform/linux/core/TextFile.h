@@ -38,7 +38,7 @@ TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_vi
 
 // All sections in file order. Nothing when any line is neither section, pair, comment nor blank.
 TAVO_PLATFORM_API std::optional<std::vector<Section>> ParseSections(std::string_view szText);
-std::string FormatSections(const std::vector<Section>& rgSections);
+TAVO_PLATFORM_API std::string FormatSections(const std::vector<Section>& rgSections);
 
 // One line of a key file as key and value; nothing for blank lines, comments and what is neither.
 std::optional<Pair> ParseKeyLine(std::string_view szLine);
