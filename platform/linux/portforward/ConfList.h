@@ -2,6 +2,7 @@
 #pragma once
 
 #include <memory>
+#include <string>
 #include <vector>
 
 #include "core/TextFile.h"
@@ -13,6 +14,12 @@ struct ConfListDeleter {
     void operator()(TAVO_PF_CONF* pHead) const { TAVOPFConfFree(pHead); }
 };
 using ConfList = std::unique_ptr<TAVO_PF_CONF, ConfListDeleter>;
+
+// The value of a key; empty for a section without keys, a missing key or one without a value.
+inline std::string Value(const TAVO_PF_CONF* pConf, const char* szKey) {
+    const char* szValue = pConf->pHash == nullptr ? nullptr : TLIBCSzHashGetValue(pConf->pHash, szKey);
+    return szValue == nullptr ? "" : szValue;
+}
 
 // Null for no sections; throws std::bad_alloc.
 ConfList MakeConfList(const std::vector<Section>& rgSections);

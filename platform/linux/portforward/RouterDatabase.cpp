@@ -16,10 +16,7 @@
 #include "core/Border.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
-
-struct tag_TAVO_ROUTER_SCRIPT {
-    tavo::ConfList pOperations;
-};
+#include "portforward/RouterScript.h"
 
 namespace {
 
@@ -33,6 +30,7 @@ constexpr int kVersionSize = 1024;
 
 using tavo::AtBorder;
 using tavo::IsPathPart;
+using tavo::Value;
 
 int Fail(int nErr, int nLine) {
     TLIBCErrSet(nErr, kFile, nLine);
@@ -73,11 +71,6 @@ void ListModel(TLIBCSzList* pList, const std::string& szBrand, const std::string
             TLIBCSzListPush(pList, (szName + "(" + szVersion + ")").c_str());
         }
     }
-}
-
-std::string Value(const TAVO_PF_CONF* pSection, const char* szKey) {
-    const char* szValue = TLIBCSzHashGetValue(pSection->pHash, szKey);
-    return szValue == nullptr ? "" : szValue;
 }
 
 // The directory of a router's description; empty when it has none.

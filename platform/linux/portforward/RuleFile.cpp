@@ -26,6 +26,7 @@ constexpr size_t kAsideSuffix = 6;
 
 using tavo::AtBorder;
 using tavo::ConfList;
+using tavo::Value;
 
 // A writer that was killed between moving the old file aside (its name and six more characters) and
 // writing the new one leaves neither: the newest copy comes back. It never replaces a file, so it is
@@ -84,11 +85,6 @@ TAVO_PF_CONF* LoadListed(const char* szPath, const char* szIdList) {
         pDropped->pNext = nullptr;
     }
     return pHead;
-}
-
-std::string Value(const TAVO_PF_CONF* pConf, const char* szKey) {
-    const char* szValue = pConf->pHash == nullptr ? nullptr : TLIBCSzHashGetValue(pConf->pHash, szKey);
-    return szValue == nullptr ? "" : szValue;
 }
 
 std::vector<tavo::Section> Sections(const TAVO_PF_CONF* pHead) {

@@ -18,13 +18,9 @@ constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 constexpr size_t kMaxDescription = 60;
 constexpr size_t kMaxRuleText = 200;
 
-std::string Value(const TAVO_PF_CONF* pRule, const char* szKey) {
-    const char* szValue = pRule->pHash == nullptr ? nullptr : TLIBCSzHashGetValue(pRule->pHash, szKey);
-    return szValue == nullptr ? "" : szValue;
-}
+}  // namespace
 
-// Our mark, then the service's name or the rule's number; plain ASCII, which every router keeps.
-std::string Description(const TAVO_PF_CONF* pRule) {
+std::string MappingDescription(const TAVO_PF_CONF* pRule) {
     const std::string szService = Value(pRule, "service");
     std::string szText = kOwnPrefix;
     for (const char c : szService.empty() ? std::string(pRule->szSection) : szService) {
@@ -33,7 +29,6 @@ std::string Description(const TAVO_PF_CONF* pRule) {
     return szText.substr(0, kMaxDescription);
 }
 
-// A key of the status file: no separator and no end of line in it.
 std::string RuleName(const TAVO_PF_CONF* pRule) {
     std::string szName = PrintableText(Value(pRule, "r_port") + "/" + Value(pRule, "protocol name"), kMaxRuleText);
     for (char& c : szName) {
@@ -41,8 +36,6 @@ std::string RuleName(const TAVO_PF_CONF* pRule) {
     }
     return szName;
 }
-
-}  // namespace
 
 bool IsRunKeyOn(const char* szRunKey) {
     char szValue[8] = {};
@@ -71,7 +64,7 @@ WantedSet ReadWanted(const char* szRunKey) {
         }
         for (const SingleMapping& single : *rgSingles) {
             RouterMapping mapping{
-                single.szProtocol, single.nRouterPort, single.nBoxPort, "", Description(pRule), 0, true};
+                single.szProtocol, single.nRouterPort, single.nBoxPort, "", MappingDescription(pRule), 0, true};
             // The first rule that asks for a port has it.
             if (setNames.insert(MappingName(mapping)).second) {
                 wanted.rgMappings.push_back(std::move(mapping));

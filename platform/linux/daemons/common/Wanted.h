@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "tavo/portforward.h"
 #include "upnp/Router.h"
 
 namespace tavo {
@@ -24,6 +25,12 @@ bool IsRunKeyOn(const char* szRunKey);
 
 // Nothing when szRunKey of the system settings is not "yes".
 WantedSet ReadWanted(const char* szRunKey);
+
+// What a router keeps as the text of a rule's mappings: our mark, then the service's name or the rule's
+// number; plain ASCII, which every router keeps.
+std::string MappingDescription(const TAVO_PF_CONF* pRule);
+// A rule as text for a user, and fit to be a key of the status file: no separator, no end of line in it.
+std::string RuleName(const TAVO_PF_CONF* pRule);
 
 // "5000/tcp", as a user reads it.
 std::string MappingName(const RouterMapping& mapping);
