@@ -1,4 +1,7 @@
-/* Addresses, routes and interfaces of the box, over netlink. */
+/*
+ * Addresses, routes and interfaces of the box, and checks of the network that it is in. Texts are cut to
+ * their field; no check needs root, starts a thread, changes anything or lasts longer than its bound.
+ */
 #ifndef TAVO_NET_H
 #define TAVO_NET_H
 
@@ -18,38 +21,47 @@ int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* s
 /* 1: both IPv4 addresses are on the subnet that szMask (dotted) makes of them; 0: they are not; -1: bad input. */
 int TAVONetIsSameSubnet(const char* szOne, const char* szOther, const char* szMask);
 
-/* One interface with an IPv4 address; all texts NUL-terminated. */
+/* One IPv4 address of an interface; all texts NUL-terminated. */
 typedef struct tag_TAVO_NET_CARD {
     char szName[16];
     char szAddress[16];
     char szMask[16];
 } TAVO_NET_CARD;
 
-/* Up to nRoom interfaces of a kind (1: all; 2: up, with an IPv4 address, no loopback), by index.
- * Number of interfaces filled in; -1: netlink failed, or bad input. */
+/* Up to nRoom IPv4 addresses of interfaces of a kind (1: all; 2: up and no loopback), in the order of the
+ * interfaces. Number filled in; -1: the system did not say, or bad input. */
 int TLIBNetGetInterfaceInfo(TAVO_NET_CARD* rgCards, int nRoom, int nKind);
-/* The interface at nIndex (from 0) of kind 2. 1: *pCard filled; 0: no such index; -1: failed. */
+/* The address at nIndex (from 0) of kind 2. 1: *pCard filled; 0: no such index; -1: failed. */
 int TAVONetGetCard1(int nIndex, TAVO_NET_CARD* pCard);
 
 /* ---- checks of the network that the box is in; 0: passed, -1: not ------------------------------- */
 
-/* The interface towards the gateway (without a gateway: any but loopback) is up and has an address.
+/* The interface towards the gateway (without a gateway: any but loopback) is up, plugged in, and has an address.
  * szInterface: its name, also when it fails and there is one. */
 int checkGwIfEnable(char* szInterface, int nSize);
 /* There is a default gateway and it is on a subnet of the box. szGateway: its address, empty when there
  * is none. */
 int checkDefaultGatewaySetting(char* szGateway, int nSize);
-/* A host outside (platform.conf, [network]) can be reached. */
+/* A host outside (platform.conf, [network]) can be reached: it answers a TCP connection, be it with a
+ * refusal, or an echo request. 4 seconds at most. */
 int checkConnectToWAN(void);
-/* A name (platform.conf, [network]) can be resolved through the box's name servers. */
+/* A name (platform.conf, [network]) can be resolved through the box's name servers. 6 seconds at most. */
 int checkDNSSetting(void);
 #ifdef __cplusplus
 }
 
 /* How many address translations stand between the box and the public network: 0 for a public address,
- * 1 behind the home router, more behind a second one or a carrier's. Looks at nHops routers at most and
- * at what the gateway says of its outside address. 0: nLevel set; -1: it could not be told, nLevel
- * untouched. */
+ * 1 behind the home router, more behind a second one or a carrier's (100.64.0.0/10, also at the box
+ * itself).
+ *
+ * The gateway is asked for its outside address, by NAT-PMP and else by UPnP; a private or a carrier's one
+ * is a second translation. A public one settles it as 1, unless routers beyond look private and a packet
+ * for that address was passed on by the gateway: then it is somebody else's. Where that settles nothing,
+ * the routers 2 to nHops on the way to the first host of platform.conf, [network], decide: a private
+ * network and a carrier's count one each, up to the first public router.
+ *
+ * 0: nLevel set; -1: the gateway says nothing and no router beyond it answers, nLevel untouched. 6 seconds
+ * at most, when a router does everything late; a well-behaved one takes less than one. */
 int getPublicIPLevel(int& nLevel, int nHops);
 #endif
 #pragma GCC visibility pop

@@ -10,9 +10,7 @@
 #include <set>
 
 #include "core/Border.h"
-#include "tavo/net.h"
 #include "tavo/upnp.h"
-#include "upnp/Igd.h"
 #include "upnp/Known.h"
 
 namespace {
@@ -47,22 +45,6 @@ int Fail(int nErr, int nLine) {
 // The client of this process; null when it has none.
 Client* Own() {
     return gPClient != nullptr && gPClient->nOwner == getpid() ? gPClient.get() : nullptr;
-}
-
-std::unique_ptr<tavo::Igd> FindGateway(int nLimitSeconds, int nLocalPort) {
-    char szGateway[16] = {};
-    char szLocal[16] = {};
-    if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0 ||
-        TAVONetLocalAddressGet(szGateway, szLocal, sizeof(szLocal), nullptr, 0) != 0) {
-        return nullptr;
-    }
-    tavo::KnownRouter known = tavo::RecallRouter(szGateway);
-    auto pIgd = tavo::Igd::Find(szGateway, szLocal, std::clamp(nLimitSeconds, 0, kMostLimitSeconds) * 1000,
-                                &known.szLocation, std::clamp(nLocalPort, 0, kMostPort));
-    if (pIgd != nullptr) {
-        tavo::KeepRouter(szGateway, known);
-    }
-    return pIgd;
 }
 
 // The entry at an index, told once: a router that ignores the index has no second entry.
@@ -124,7 +106,8 @@ int TAVOUpnpInit(int nLimitSeconds, int nLocalPort) {
     TAVOUpnpCleanup();
     return tavo::AtBorder(kNotFound, [&] {
         auto pClient = std::make_unique<Client>();
-        pClient->pIgd = FindGateway(nLimitSeconds, nLocalPort);
+        pClient->pIgd = tavo::FindGatewayIgd(std::clamp(nLimitSeconds, 0, kMostLimitSeconds) * 1000,
+                                             std::clamp(nLocalPort, 0, kMostPort));
         if (pClient->pIgd == nullptr) {
             TLIBCErrSet(TLIBC_ERR_NOT_FOUND, kFile, __LINE__);
             return kNotFound;

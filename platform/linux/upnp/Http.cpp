@@ -5,6 +5,7 @@
 
 #include <curl/curl.h>
 
+#include <algorithm>
 #include <new>
 
 namespace tavo {
@@ -87,12 +88,17 @@ std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl) {
 
 struct HttpClient::Impl {
     CURL* pCurl = curl_easy_init();
+    long nLimitMilliseconds = kRequestMilliseconds;
     ~Impl() { curl_easy_cleanup(pCurl); }
 };
 
 HttpClient::HttpClient() : mPImpl(std::make_unique<Impl>()) {}
 
 HttpClient::~HttpClient() = default;
+
+void HttpClient::SetLimit(int nMilliseconds) {
+    mPImpl->nLimitMilliseconds = std::clamp<long>(nMilliseconds, 1, kRequestMilliseconds);
+}
 
 HttpAnswer HttpClient::Get(const HttpUrl& url) {
     return Perform(url, {}, nullptr);
@@ -119,8 +125,8 @@ HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string
     curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);
     curl_easy_setopt(pCurl, CURLOPT_TCP_NODELAY, 1L);
-    curl_easy_setopt(pCurl, CURLOPT_CONNECTTIMEOUT_MS, kConnectMilliseconds);
-    curl_easy_setopt(pCurl, CURLOPT_TIMEOUT_MS, kRequestMilliseconds);
+    curl_easy_setopt(pCurl, CURLOPT_CONNECTTIMEOUT_MS, std::min(kConnectMilliseconds, mPImpl->nLimitMilliseconds));
+    curl_easy_setopt(pCurl, CURLOPT_TIMEOUT_MS, mPImpl->nLimitMilliseconds);
     curl_easy_setopt(pCurl, CURLOPT_USERAGENT, "Linux UPnP/1.1 tavo/1.0");
     curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
     curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakeBody);

@@ -37,6 +37,8 @@ public:
     HttpClient(const HttpClient&) = delete;
     HttpClient& operator=(const HttpClient&) = delete;
 
+    // The most that one request may take from now on.
+    void SetLimit(int nMilliseconds);
     HttpAnswer Get(const HttpUrl& url);
     HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders, const std::string& szBody);
 

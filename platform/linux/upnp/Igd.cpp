@@ -245,6 +245,11 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
                                std::string* pSzLocation, int nLocalPort) {
     std::unique_ptr<Igd> pFound;
     HttpClient http;
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(nLimitMilliseconds);
+    const auto fnLeft = [&] {
+        return static_cast<int>(
+            std::chrono::duration_cast<std::chrono::milliseconds>(end - std::chrono::steady_clock::now()).count());
+    };
     const auto fnTry = [&](const HttpUrl& location) {
         const HttpAnswer answer = http.Get(location);
         if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
@@ -262,11 +267,15 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
     };
     if (pSzLocation != nullptr && !pSzLocation->empty()) {
         const auto known = ParseHttpUrl(*pSzLocation);
+        http.SetLimit(nLimitMilliseconds / 2);
         if (known && known->szHost == szGateway && fnTry(*known)) {
             return pFound;
         }
     }
-    SearchGateway(szGateway, szLocal, nLimitMilliseconds, nLocalPort, fnTry);
+    SearchGateway(szGateway, szLocal, fnLeft(), nLocalPort, [&](const HttpUrl& location) {
+        http.SetLimit(fnLeft());
+        return fnTry(location);
+    });
     return pFound;
 }
 

@@ -36,11 +36,13 @@ TAVO_PLATFORM_API int SoapCode(long nHttpCode, const std::string& szXml);
 
 class TAVO_PLATFORM_API Igd : public Router {
 public:
-    // The IGD at the gateway: pSzLocation (may be null) is tried first and set to what worked. A search
-    // lasts as SearchGateway says.
+    // The IGD at the gateway, found within the limit or not at all. pSzLocation (may be null) is tried
+    // first, for half of it at most, and set to what worked. A search lasts as SearchGateway says.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
                                      std::string* pSzLocation, int nLocalPort = 0);
 
+    // The most that one call may take from now on.
+    void SetCallLimit(int nMilliseconds) { mHttp.SetLimit(nMilliseconds); }
     // The entry at an index. One that makes no sense comes back disabled and without a protocol.
     int GetAt(int nIndex, RouterMapping& mapping);
     // The router's address on its other side, as it says itself.

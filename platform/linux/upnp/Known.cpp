@@ -2,12 +2,14 @@
 // Promises: see Known.h.
 #include "upnp/Known.h"
 
+#include <netinet/in.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
 #include <memory>
 
 #include "tavo/core.h"
+#include "tavo/net.h"
 
 namespace tavo {
 
@@ -40,6 +42,21 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
         syslog(LOG_WARNING, "cannot write %s", kStateFile);
     }
+}
+
+std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort) {
+    char szGateway[INET_ADDRSTRLEN] = {};
+    char szLocal[INET_ADDRSTRLEN] = {};
+    if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0 ||
+        TAVONetLocalAddressGet(szGateway, szLocal, sizeof(szLocal), nullptr, 0) != 0) {
+        return nullptr;
+    }
+    KnownRouter known = RecallRouter(szGateway);
+    auto pIgd = Igd::Find(szGateway, szLocal, nLimitMilliseconds, &known.szLocation, nLocalPort);
+    if (pIgd != nullptr) {
+        KeepRouter(szGateway, known);
+    }
+    return pIgd;
 }
 
 }  // namespace tavo

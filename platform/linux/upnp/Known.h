@@ -1,11 +1,13 @@
-// What was learnt about a router, kept between runs and shared by upnpd and the client.
+// What was learnt about a router, kept between runs and shared by upnpd, the client and the checks.
 // Relies on a sectioned file below /var/lib/tavo. Promises: a file that is missing or damaged is
 // "nothing known".
 #pragma once
 
+#include <memory>
 #include <string>
 
 #include "core/Export.h"
+#include "upnp/Igd.h"
 
 namespace tavo {
 
@@ -17,5 +19,9 @@ struct KnownRouter {
 TAVO_PLATFORM_API KnownRouter RecallRouter(const std::string& szGateway);
 // Writes only what differs from what is there; a failure is logged.
 TAVO_PLATFORM_API void KeepRouter(const std::string& szGateway, const KnownRouter& router);
+
+// The IGD at the default gateway: where it was the last time, else searched for; what worked is kept.
+// Null when there is no gateway, or no IGD at it.
+std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort);
 
 }  // namespace tavo

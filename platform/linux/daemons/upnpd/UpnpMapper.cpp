@@ -12,7 +12,7 @@ namespace {
 
 constexpr DaemonNames kNames{
     "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
-constexpr int kDiscoveryMilliseconds = 5000;
+constexpr int kDiscoveryMilliseconds = 8000;
 
 }  // namespace
 

@@ -1,0 +1,113 @@
+// The network checks: what addresses tell, and that each check ends where nothing answers.
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+
+#include "net/Level.h"
+#include "tavo/net.h"
+#include "world.h"
+
+namespace {
+
+using tavo::AddressKind;
+
+in_addr Address(const char* szText) {
+    in_addr address = {};
+    EXPECT_EQ(inet_pton(AF_INET, szText, &address), 1) << szText;
+    return address;
+}
+
+TEST(Level, AddressesAreToldApartAtTheEdgesOfTheirBlocks) {
+    const std::pair<AddressKind, std::vector<const char*>> rgCases[] = {
+        {AddressKind::kPublic,
+         {"1.0.0.0", "9.255.255.255", "11.0.0.0", "100.63.255.255", "100.128.0.0", "172.15.255.255", "172.32.0.0",
+          "192.167.255.255", "192.169.0.0", "192.0.2.1", "198.51.100.1", "203.0.113.1", "223.255.255.255"}},
+        {AddressKind::kPrivate,
+         {"10.0.0.0", "10.255.255.255", "172.16.0.0", "172.31.255.255", "192.168.0.0", "192.168.255.255"}},
+        {AddressKind::kCarrier, {"100.64.0.0", "100.127.255.255"}},
+        {AddressKind::kNone, {"0.0.0.0", "127.0.0.1", "169.254.0.1", "224.0.0.1", "255.255.255.255"}}};
+    for (const auto& [enKind, rgszAddresses] : rgCases) {
+        for (const char* szAddress : rgszAddresses) {
+            EXPECT_EQ(tavo::KindOf(Address(szAddress)), enKind) << szAddress;
+        }
+    }
+}
+
+TEST(Level, CountsEveryTranslationThatTheEvidenceShowsAndNoOther) {
+    constexpr const char* kNone = nullptr;
+    constexpr int kUntold = -1;
+    struct Case {
+        const char* szOwn;
+        const char* szExternal;
+        bool blElsewhere;
+        std::vector<const char*> rgszBeyond;
+        int nLevel;
+    };
+    const Case rgCases[] = {
+        {"203.0.113.5", kNone, false, {}, 0},
+        {"192.168.1.5", "198.41.0.4", false, {}, 1},
+        {"192.168.1.5", "198.41.0.4", false, {"10.1.1.1", "100.64.0.1"}, 1},  // the provider's own routers
+        {"192.168.1.5", "198.41.0.4", true, {"10.1.1.1", "203.0.113.1"}, 2},  // the address of the second router
+        {"192.168.1.5", "198.41.0.4", true, {"203.0.113.1"}, 1},
+        {"192.168.1.5", "192.168.0.2", false, {}, 2},
+        {"192.168.1.5", "100.64.0.2", false, {"203.0.113.1"}, 2},
+        {"192.168.1.5", "100.64.0.2", false, {"10.1.1.1", "203.0.113.1"}, 2},
+        {"192.168.1.5", "10.0.0.2", false, {"10.0.0.1", "100.64.0.1", "203.0.113.1"}, 3},
+        {"192.168.1.5", kNone, false, {"203.0.113.1", "10.0.0.1"}, 1},
+        {"192.168.1.5", kNone, false, {kNone, "10.0.0.1"}, 2},
+        {"192.168.1.5", kNone, false, {kNone, "100.64.0.1", "10.0.0.1"}, 2},
+        {"192.168.1.5", kNone, false, {"192.168.0.1", "10.0.0.1", "203.0.113.1"}, 2},
+        {"192.168.1.5", kNone, false, {"169.254.1.1", kNone}, kUntold},
+        {"192.168.1.5", kNone, false, {}, kUntold},
+        {"192.168.1.5", "169.254.1.1", false, {kNone, "203.0.113.1"}, 1},
+        {"100.64.0.5", kNone, false, {}, 2},
+        {"169.254.1.5", kNone, false, {}, kUntold}};
+    for (const Case& check : rgCases) {
+        tavo::LevelEvidence evidence;
+        evidence.own = Address(check.szOwn);
+        if (check.szExternal != nullptr) {
+            evidence.external = Address(check.szExternal);
+        }
+        evidence.blExternalElsewhere = check.blElsewhere;
+        for (const char* szRouter : check.rgszBeyond) {
+            evidence.rgBeyond.push_back(szRouter == nullptr ? std::nullopt : std::optional<in_addr>(Address(szRouter)));
+        }
+        EXPECT_EQ(tavo::LevelOf(evidence).value_or(kUntold), check.nLevel)
+            << &check - rgCases << ": " << check.szOwn << " " << (check.szExternal == nullptr ? "-" : check.szExternal);
+    }
+}
+
+TEST(NetworkChecks, FailAtOnceInABoxWithoutANetwork) {
+    const auto start = std::chrono::steady_clock::now();
+    char szText[1024] = "x";
+    gSzGateway.clear();
+    EXPECT_EQ(checkDefaultGatewaySetting(szText, sizeof(szText)), -1);
+    EXPECT_STREQ(szText, "");
+    gSzGateway = "192.168.1.1";
+    EXPECT_EQ(checkDefaultGatewaySetting(szText, sizeof(szText)), -1);
+    EXPECT_STREQ(szText, "192.168.1.1");
+    EXPECT_EQ(checkGwIfEnable(szText, sizeof(szText)), -1);
+    EXPECT_EQ(checkConnectToWAN(), -1);
+    EXPECT_EQ(checkDNSSetting(), -1);
+    int nLevel = 7;
+    EXPECT_EQ(getPublicIPLevel(nLevel, 3), -1);
+    EXPECT_EQ(nLevel, 7);
+    TAVO_NET_CARD card = {};
+    EXPECT_EQ(TLIBNetGetInterfaceInfo(&card, 1, 2), 0);
+    EXPECT_EQ(TAVONetGetCard1(0, &card), 0);
+    EXPECT_EQ(TLIBNetGetInterfaceInfo(&card, 1, 1), 1);
+    EXPECT_STREQ(card.szAddress, "127.0.0.1");
+    EXPECT_STREQ(card.szMask, "255.0.0.0");
+    EXPECT_EQ(TLIBNetGetInterfaceInfo(nullptr, 1, 1) + TLIBNetGetInterfaceInfo(&card, 1, 3), -2);
+    // A connection refused is a host reached, and entries that are none are left out.
+    Write("/etc/tavo/platform.conf", "[network]\nwan_hosts=\"nonsense 1.2.3.4 1.2.3.4:0 127.0.0.1:9 \"\n");
+    EXPECT_EQ(checkConnectToWAN(), 0);
+    Write("/etc/tavo/platform.conf", "[network]\nwan_hosts=\" \"\n");
+    EXPECT_EQ(checkConnectToWAN(), -1);
+    EXPECT_EQ(getPublicIPLevel(nLevel, 3), -1);
+    std::filesystem::remove("/etc/tavo/platform.conf");
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(7));
+}
+
+}  // namespace
