@@ -58,7 +58,7 @@ int checkDNSSetting(void);
  * is a second translation. A public one settles it as 1, unless routers beyond look private and a packet
  * for that address was passed on by the gateway: then it is somebody else's. Where that settles nothing,
  * the routers 2 to nHops on the way to the first host of platform.conf, [network], decide: a private
- * network and a carrier's count one each, up to the first public router.
+ * network and a carrier's count one each, up to the first public router; a silent router counts nothing.
  *
  * 0: nLevel set; -1: the gateway says nothing and no router beyond it answers, nLevel untouched. 6 seconds
  * at most, when a router does everything late; a well-behaved one takes less than one. */

@@ -139,10 +139,12 @@ std::optional<int> Level(const sockaddr_in& host, int nHops) {
             router.reset();
         }
     }
-    // Asked only where it decides.
+    // Asked only where it decides: a public address outside, private routers beyond.
     evidence.blExternalElsewhere = true;
-    const std::optional<int> most = tavo::LevelOf(evidence);
-    evidence.blExternalElsewhere = most > 1 && evidence.external && IsPassedOn(*evidence.external);
+    if (evidence.external && tavo::KindOf(*evidence.external) == tavo::AddressKind::kPublic &&
+        tavo::LevelOf(evidence) > 1) {
+        evidence.blExternalElsewhere = IsPassedOn(*evidence.external);
+    }
     return tavo::LevelOf(evidence);
 }
 
