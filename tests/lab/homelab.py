@@ -91,6 +91,25 @@ def wait_for(condition, seconds, what):
         time.sleep(0.05)
 
 
+class Detached:
+    """A process that went into the background by itself, with what Lab.end() asks of a process."""
+
+    def __init__(self, pid_file):
+        wait_for(lambda: os.path.exists(pid_file) and os.path.getsize(pid_file), 5, f"{pid_file} is there")
+        with open(pid_file, encoding="ascii") as file:
+            self.pid = int(file.read())
+        os.unlink(pid_file)
+
+    def poll(self):
+        return None if os.path.exists(f"/proc/{self.pid}") else 0
+
+    def kill(self):
+        os.kill(self.pid, signal.SIGKILL)
+
+    def wait(self):
+        wait_for(lambda: self.poll() is not None, 5, f"process {self.pid} has ended")
+
+
 class Lab:
     def __init__(self):
         self.processes = []
@@ -182,8 +201,11 @@ class Lab:
             "upnp_nat_postrouting_chain=postrouting_miniupnpd", "uuid=00000000-0000-0000-0000-000000000001",
             "force_igd_desc_v1=" + ("yes" if version1 else "no"), "allow 1-65535 192.168.77.0/24 1-65535",
             "deny 0-65535 0.0.0.0/0 0-65535", "")))
-        self.router = self.start("router", "/usr/sbin/miniupnpd", "-d", "-f", "/tmp/miniupnpd.conf",
-                                 stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+        # In the background as on any router: kept in front it runs in debug mode, where it logs every entry
+        # that it looks at, and on a machine without a system log it does so on a serial console.
+        self.run("router", "/usr/sbin/miniupnpd -f /tmp/miniupnpd.conf -P /tmp/miniupnpd.pid >/dev/null 2>&1")
+        self.router = Detached("/tmp/miniupnpd.pid")
+        self.processes.append(self.router)
         wait_for(lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
                                   check=False).returncode == 0, 10, "the router is up")
 

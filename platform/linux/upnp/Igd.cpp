@@ -209,6 +209,28 @@ bool ReadKey(const XMLElement* pRoot, RouterMapping& mapping) {
     return nRouterPort.has_value() && (mapping.szProtocol == "TCP" || mapping.szProtocol == "UDP");
 }
 
+// The entries of a listing, which is a document inside the answer. Those that make no sense are left out.
+std::vector<RouterMapping> ParseListing(const std::string& szAnswer) {
+    XMLDocument document;
+    document.Parse(szAnswer.data(), szAnswer.size());
+    const XMLElement* pListing = FindElement(document.RootElement(), "NewPortListing");
+    const char* szListing = pListing == nullptr ? nullptr : pListing->GetText();
+    XMLDocument listing;
+    std::vector<RouterMapping> rgMappings;
+    if (szListing == nullptr || listing.Parse(szListing) != tinyxml2::XML_SUCCESS) {
+        return rgMappings;
+    }
+    const XMLElement* pEntry = listing.RootElement() == nullptr ? nullptr : listing.RootElement()->FirstChildElement();
+    for (; pEntry != nullptr; pEntry = pEntry->NextSiblingElement()) {
+        RouterMapping mapping;
+        const XMLElement* pFields = pEntry->FirstChildElement();
+        if (ReadKey(pFields, mapping) && ReadEntry(pFields, mapping)) {
+            rgMappings.push_back(std::move(mapping));
+        }
+    }
+    return rgMappings;
+}
+
 }  // namespace
 
 std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location) {
@@ -356,6 +378,26 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
     }
     rgMappings = std::move(rgRead);
     return kRouterOk;
+}
+
+int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                   std::vector<RouterMapping>& rgMappings) {
+    if (!mBlRanges) {
+        return kRouterInvalidAction;
+    }
+    std::string szAnswer;
+    const int nCode = Call("GetListOfPortMappings",
+                           {{"NewStartPort", std::to_string(nFirst)},
+                            {"NewEndPort", std::to_string(nLast)},
+                            {"NewProtocol", szProtocol},
+                            {"NewManage", "0"},
+                            {"NewNumberOfPorts", "0"}},
+                           szAnswer);
+    mBlRanges = nCode == kRouterOk;
+    if (nCode == kRouterOk) {
+        rgMappings = ParseListing(szAnswer);
+    }
+    return nCode;
 }
 
 int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) {

@@ -48,6 +48,8 @@ public:
     // The router's address on its other side, as it says itself.
     int ExternalAddress(std::string& szAddress);
     int List(std::vector<RouterMapping>& rgMappings) override;
+    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                  std::vector<RouterMapping>& rgMappings) override;
     int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override;
     int Add(const RouterMapping& mapping) override;
     int Remove(const std::string& szProtocol, uint16_t nRouterPort) override;
@@ -59,10 +61,11 @@ private:
         const char* szName;
         std::string szValue;
     };
-    explicit Igd(IgdService service) : mService(std::move(service)) {}
+    explicit Igd(IgdService service) : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")) {}
     int Call(const char* szAction, const std::vector<Argument>& rgArguments, std::string& szAnswer);
 
     IgdService mService;
+    bool mBlRanges;  // services of the second generation show ranges, unless they once could not
     HttpClient mHttp;
 };
 

@@ -26,6 +26,7 @@ enum RouterCode : int {
     kRouterTimeout = -1,
     kRouterUnreachable = -2,
     kRouterGarbage = -3,
+    kRouterInvalidAction = 401,
     kRouterInvalidArgs = 402,
     kRouterNoSuchIndex = 713,
     kRouterNoSuchEntry = 714,
@@ -38,6 +39,12 @@ public:
     virtual ~Router() = default;
     // Outputs are set only with kRouterOk.
     virtual int List(std::vector<RouterMapping>& rgMappings) = 0;
+    // The box's own mappings between two ports, where the router can show them at once. May leave some
+    // out: what it shows is there, what it does not show may be there too.
+    virtual int ListRange(const std::string& /*szProtocol*/, uint16_t /*nFirst*/, uint16_t /*nLast*/,
+                          std::vector<RouterMapping>& /*rgMappings*/) {
+        return kRouterInvalidAction;
+    }
     virtual int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) = 0;
     virtual int Add(const RouterMapping& mapping) = 0;
     virtual int Remove(const std::string& szProtocol, uint16_t nRouterPort) = 0;

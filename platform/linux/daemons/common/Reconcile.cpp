@@ -1,7 +1,10 @@
 // Compares before it writes: an unchanged set costs one listing. Relies on a Router.
-// Promises: see Reconcile.h.
+// Reads back what it wrote in batches, because a router reads its own table faster while nobody writes
+// to it, and some show a whole range at once. Promises: see Reconcile.h.
 #include "daemons/common/Reconcile.h"
 
+#include <algorithm>
+#include <chrono>
 #include <map>
 #include <optional>
 
@@ -10,6 +13,10 @@
 namespace tavo {
 
 namespace {
+
+constexpr auto kReadBackAfter = std::chrono::seconds(20);  // a slow router's yes is not left open for longer
+constexpr int kRangeFrom = 4;                              // a range costs a request a protocol
+constexpr char kWritten[] = "written";                     // the router said yes, and has not shown it yet
 
 using Key = std::pair<std::string, uint16_t>;
 
@@ -37,7 +44,9 @@ private:
     std::string Place(const RouterMapping& wanted);
     std::string Create(const RouterMapping& wanted);
     int AddWithLease(RouterMapping mapping);
-    std::string ReadBack(const RouterMapping& wanted);
+    std::map<Key, RouterMapping> ShowRanges(const std::vector<RouterMapping>& rgWanted);
+    void ReadBack(const std::vector<RouterMapping>& rgWanted);
+    std::string Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown);
     std::string AfterConflict(const RouterMapping& wanted);
     void NoteLease(uint32_t nLease);
 
@@ -48,6 +57,8 @@ private:
     std::map<Key, RouterMapping> mMapTable;
     PassResult mResult;
     PassGuard mGuard;
+    size_t mNRead = 0;  // statuses up to here are not kWritten
+    std::chrono::steady_clock::time_point mReadBack = std::chrono::steady_clock::now();
 };
 
 void Pass::NoteLease(uint32_t nLease) {
@@ -78,7 +89,11 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     for (const RouterMapping& wanted : rgWanted) {
         const std::string szStatus = IsOver() ? CodeText(mResult.nTransport) : Place(wanted);
         mResult.rgStatus.emplace_back(MappingName(wanted), szStatus);
+        if (std::chrono::steady_clock::now() - mReadBack > kReadBackAfter) {
+            ReadBack(rgWanted);
+        }
     }
+    ReadBack(rgWanted);
     return mResult;
 }
 
@@ -108,7 +123,7 @@ std::string Pass::Place(const RouterMapping& wanted) {
     }
     const bool blDue = mBlRenew && it->second.nLease != 0;
     if (blDue && Note(AddWithLease(wanted)) == kRouterOk) {
-        return ReadBack(wanted);
+        return kWritten;
     }
     NoteLease(it->second.nLease);
     return "1";
@@ -119,7 +134,7 @@ std::string Pass::Create(const RouterMapping& wanted) {
     if (nCode == kRouterConflict) {
         return AfterConflict(wanted);
     }
-    return nCode == kRouterOk ? ReadBack(wanted) : CodeText(nCode);
+    return nCode == kRouterOk ? kWritten : CodeText(nCode);
 }
 
 // Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
@@ -136,8 +151,50 @@ int Pass::AddWithLease(RouterMapping mapping) {
     return nCode;
 }
 
+// What the router shows of what was written, where it can show ranges; may be incomplete.
+std::map<Key, RouterMapping> Pass::ShowRanges(const std::vector<RouterMapping>& rgWanted) {
+    std::map<std::string, std::pair<uint16_t, uint16_t>> mapRanges;
+    int nWritten = 0;
+    for (size_t i = mNRead; i < mResult.rgStatus.size(); ++i) {
+        if (mResult.rgStatus[i].second == kWritten) {
+            const uint16_t nPort = rgWanted[i].nRouterPort;
+            auto& range = mapRanges.try_emplace(rgWanted[i].szProtocol, nPort, nPort).first->second;
+            range = {std::min(range.first, nPort), std::max(range.second, nPort)};
+            ++nWritten;
+        }
+    }
+    std::map<Key, RouterMapping> mapShown;
+    for (auto it = mapRanges.begin(); nWritten >= kRangeFrom && it != mapRanges.end() && !IsOver(); ++it) {
+        std::vector<RouterMapping> rgShown;
+        Note(mRouter.ListRange(it->first, it->second.first, it->second.second, rgShown));
+        for (RouterMapping& shown : rgShown) {
+            const Key key = KeyOf(shown);
+            mapShown.emplace(key, std::move(shown));
+        }
+    }
+    return mapShown;
+}
+
 // A router's yes is not enough: the mapping must be in its table, and be ours.
-std::string Pass::ReadBack(const RouterMapping& wanted) {
+void Pass::ReadBack(const std::vector<RouterMapping>& rgWanted) {
+    const std::map<Key, RouterMapping> mapShown = ShowRanges(rgWanted);
+    for (; mNRead < mResult.rgStatus.size(); ++mNRead) {
+        if (mResult.rgStatus[mNRead].second == kWritten) {
+            mResult.rgStatus[mNRead].second = Confirm(rgWanted[mNRead], mapShown);
+        }
+    }
+    mReadBack = std::chrono::steady_clock::now();
+}
+
+std::string Pass::Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown) {
+    const auto it = mapShown.find(KeyOf(wanted));
+    if (it != mapShown.end() && Serves(it->second, wanted)) {
+        NoteLease(it->second.nLease);
+        return "1";
+    }
+    if (IsOver()) {
+        return CodeText(mResult.nTransport);
+    }
     RouterMapping entry;
     const int nCode = Note(mRouter.Get(wanted.szProtocol, wanted.nRouterPort, entry));
     if (nCode == kRouterNoSuchEntry) {
@@ -166,7 +223,7 @@ std::string Pass::AfterConflict(const RouterMapping& wanted) {
         return CodeText(kRouterConflict);
     }
     const int nCode = Note(AddWithLease(wanted));
-    return nCode == kRouterOk ? ReadBack(wanted) : CodeText(nCode);
+    return nCode == kRouterOk ? kWritten : CodeText(nCode);
 }
 
 }  // namespace
