@@ -19,6 +19,7 @@
 #ifdef __cplusplus
 #include <json/value.h>
 
+#include <list>
 #include <string>
 #endif
 
@@ -286,8 +287,24 @@ TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUT
                            __tag_TAVO_ROUTER_SAVE_RULE_RESULT* saveResult,
                            void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData);
 
+/* ---- relay service: diagnostics, what they find goes to standard output ----------------------------- */
+
+/* At most ten numbers ("1,2,3,7") as a port list ("1-3, 7"), cut at nOut - 1. 0 or -1. */
+TAVO_API int TestFuncToPorts(char* szOut, int nOut, const char* szNumbers);
+/* Prints the rules of rule.conf with their ports taken apart. 0 or -1. */
+TAVO_API int TestFuncCreateOpRulesByRuleConf(void);
+
 #ifdef __cplusplus
 } /* extern "C" */
+
+/* ---- relay service ------------------------------------------------------------------------------ */
+
+/* Appends the ports of a text ("80,443,8000-8010"; a range written backwards counts forwards) in their
+ * order, duplicates kept. 0, or -1: null, no port at all, or one outside 1 to 65535; what stood before it
+ * has been appended. */
+TAVO_API int TLibParsePorts(std::list<int>& ports, const char* szPort);
+/* The same. */
+TAVO_API int TestFuncTLibParsePorts(std::list<int>& ports, char* szPort);
 
 /* Opens (creating it) and locks szPath without waiting; fd receives the descriptor also when the lock
  * is held elsewhere: pass it to unlock_file in every case. 1: locked; 0: not. */

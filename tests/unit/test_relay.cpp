@@ -1,0 +1,447 @@
+// The relay service's part: port lists as text, operation rules, and who keeps a port in a merge.
+#include <gtest/gtest.h>
+
+#include <climits>
+#include <numeric>
+#include <random>
+
+#include "naive_conflicts.h"
+#include "world.h"
+
+namespace {
+
+using namespace tavo::lib;
+using Ports = PortList;
+using Lines = std::vector<std::string>;
+
+class Relay : public testing::Test {
+protected:
+    void SetUp() override { gLog.clear(); }
+};
+
+// ---- port lists ---------------------------------------------------------------------------------------
+
+TEST_F(Relay, PortListsAreReadInTheirOrder) {
+    const struct {
+        const char* szText;
+        Ports ports;
+        const char* szLine;  // what a failure logs; empty: success
+    } rgCases[] = {
+        {"80", {80}, ""},
+        {"80,443", {80, 443}, ""},
+        {",80,,", {80}, ""},
+        {"8000-8002", {8000, 8001, 8002}, ""},
+        {"8002-8000", {8000, 8001, 8002}, ""},
+        {"80,80", {80, 80}, ""},
+        {"443, 80", {443, 80}, ""},
+        {"80abc", {80}, ""},
+        {"5-6-9", {5, 6}, ""},
+        {"65535-65535", {65535}, ""},
+        {"", {}, "invalid port format"},
+        {",", {}, "invalid port format"},
+        {"abc", {}, "invalid port no [abc]"},
+        {"7,0,8", {7}, "invalid port no [0]"},
+        {"70000", {}, "invalid port no [70000]"},
+        {"4294967376", {}, "invalid port no [4294967376]"},
+        {"5-", {}, "invalid port range [5-0]"},
+        {"-5", {}, "invalid port range [-5-0]"},
+        {"9,8-65536", {9}, "invalid port range [8-65536]"},
+        {"4294967376-4294967377", {}, "invalid port range [2147483647-2147483647]"},
+    };
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        Ports ports = {1};
+        EXPECT_EQ(TLibParsePorts(ports, c.szText), *c.szLine == '\0' ? 0 : -1) << c.szText;
+        EXPECT_EQ(ports.front(), 1);
+        ports.pop_front();
+        EXPECT_EQ(ports, c.ports) << c.szText;
+        EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
+    }
+    Ports ports;
+    EXPECT_EQ(TLibParsePorts(ports, nullptr), -1);
+    EXPECT_TRUE(Logged("Bad parameter, NULL == szPort"));
+    EXPECT_EQ(TLibParsePorts(ports, "1-65535"), 0);
+    EXPECT_EQ(ports.size(), 65535U);
+}
+
+TEST_F(Relay, PortListsAreWrittenAsRuns) {
+    const struct {
+        Ports ports;
+        int nSize;
+        const char* szText;
+        const char* szLine;
+    } rgCases[] = {
+        {{80, 81, 82, 90}, 1024, "80-82, 90", ""},
+        {{80, 81, 82, 90}, 4, "80-", ""},
+        {{5, 4, 3}, 1024, "5-3", ""},
+        {{1, 2, 1, 2}, 1024, "1-2", ""},
+        {{1, 2, 9, 10, 20}, 1024, "1-2, 9-10, 20", ""},
+        {{80, 80}, 1024, "80, 80", ""},
+        {{}, 1024, "", ""},
+        {{80, 0}, 1024, "kept", "TAVOPFIsValidPortNo(0) failed"},
+        {{80}, 0, "kept", "Bad parameter, nOutPorts=0"},
+    };
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        char szOut[1024] = "kept";
+        EXPECT_EQ(ToPorts(szOut, c.nSize, c.ports), *c.szLine == '\0' ? 0 : -1) << c.szText;
+        EXPECT_STREQ(szOut, c.szText);
+        EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
+    }
+    EXPECT_EQ(ToPorts(nullptr, 5, {}), -1);
+    EXPECT_TRUE(Logged("Bad parameter, szOutPorts is NULL"));
+    char szOut[8] = "kept";
+    EXPECT_EQ(TestFuncToPorts(szOut, 8, "1,2,3,7"), 0);
+    EXPECT_STREQ(szOut, "1-3, 7");
+    EXPECT_EQ(TestFuncToPorts(szOut, 8, "1,2,3,4,5,6,7,8,9,10,11"), -1);
+    EXPECT_EQ(TestFuncToPorts(szOut, 8, ""), 0);
+    EXPECT_STREQ(szOut, "");
+}
+
+// ---- operation rules ------------------------------------------------------------------------------------
+
+__tag_TAVO_PORTMAP_RULE Request(const char* szPorts, int nProtocol) {
+    __tag_TAVO_PORTMAP_RULE request = {};
+    FillText(request.szPorts, szPorts);
+    request.enProtocol = nProtocol;
+    return request;
+}
+
+TEST_F(Relay, RequestsBecomeRules) {
+    const __tag_TAVO_PORTMAP_RULE rgRequests[] = {Request("5000-5001", 0), Request("7,6", 9)};
+    for (const auto& [szName, szId] : {std::pair("hoplink", "HopLink"), std::pair("HopLink", "")}) {
+        OperationRules rules;
+        ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, szName, rgRequests, 2), 0);
+        ASSERT_EQ(rules.nRules, 2);
+        EXPECT_TRUE(rules.rgRules[0].blEnable);
+        EXPECT_EQ(*rules.rgRules[0].routerPortSet, Ports({5000, 5001}));
+        EXPECT_EQ(*rules.rgRules[1].boxPortSet, Ports({7, 6}));
+        EXPECT_EQ(rules.rgRules[1].protocol, 9);
+        EXPECT_STREQ(rules.rgRules[1].szServiceId, szId);
+        EXPECT_STREQ(rules.rgRules[1].szServiceName, szName);
+    }
+    OPERATION_RULE* pOut = nullptr;
+    int nOut = 7;
+    const __tag_TAVO_PORTMAP_RULE rgBad[] = {Request("1", 0), Request("0", 0)};
+    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", rgBad, 2), -1);
+    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, nullptr, rgBad, 2), -1);
+    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", rgBad, -1), -1);
+    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", nullptr, 1), -1);
+    EXPECT_EQ(pOut, nullptr);
+    EXPECT_EQ(nOut, 0);
+    EXPECT_EQ(gLog, Lines({"invalid port no [0]", "TLibParsePorts() for routerPort failed",
+                           "Bad parameter, szServiceName is NULL", "Bad parameter, 0 > nRules=-1",
+                           "Bad parameter, nRules=1 >0, but rgRules is NULL"}));
+    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", nullptr, 0), 0);
+}
+
+__tag_TAVO_ROUTER_RULE Stored(const char* szProtocol, const char* szRouter, const char* szBox, const char* szService,
+                              bool blEnable) {
+    __tag_TAVO_ROUTER_RULE rule = {};
+    rule.blEnable = blEnable;
+    FillText(rule.szProtocol, szProtocol);
+    FillText(rule.szRouterPort, szRouter);
+    FillText(rule.szSrcPort, szBox);
+    FillText(rule.szServiceID, "id");
+    FillText(rule.szServiceName, szService);
+    return rule;
+}
+
+TEST_F(Relay, StoredRulesComeBackRenumbered) {
+    const __tag_TAVO_ROUTER_RULE rgStored[] = {Stored("udp", "1,2,3", "7,8,9", "web", false),
+                                               Stored("all", "5", "5", "", true), Stored("tcp", "6", "6", "", true)};
+    OperationRules rules;
+    ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, rgStored, 3), 0);
+    rules.rgRules[1].blDeleted = true;
+    {
+        RouterRules back;
+        ASSERT_EQ(CreateRulesArray(&back.rgRules, &back.nRules, rules.rgRules, 3, rules.rgRules, 1), 0);
+        ASSERT_EQ(back.nRules, 3);
+        EXPECT_STREQ(back.rgRules[0].szRouterPort, "1-3");
+        EXPECT_STREQ(back.rgRules[0].szSrcPort, "7-9");
+        EXPECT_STREQ(back.rgRules[0].szProtocol, "udp");
+        EXPECT_STREQ(back.rgRules[0].szServiceID, "id");
+        EXPECT_STREQ(back.rgRules[0].szServiceName, "web");
+        EXPECT_FALSE(back.rgRules[0].blEnable);
+        EXPECT_STREQ(back.rgRules[1].szRuleID, "2");
+        EXPECT_STREQ(back.rgRules[1].szSrcPort, "6");
+        EXPECT_STREQ(back.rgRules[2].szRuleID, "3");
+    }
+    RouterRules none;
+    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 0, rules.rgRules + 1, 1), 0);
+    EXPECT_EQ(none.rgRules, nullptr);
+    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 1, nullptr, 0), -1);
+    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 0, nullptr, 1), -1);
+    rules.rgRules[2].routerPortSet->push_back(0);
+    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, rules.rgRules, 3, nullptr, 0), -1);
+    EXPECT_EQ(none.nRules, 0);
+    int cRules = 1;
+    __tag_TAVO_ROUTER_RULE rgRoom[1];
+    EXPECT_EQ(WriteRouterRules(&cRules, rgRoom, 1, rules.rgRules, 1), -1);
+    EXPECT_EQ(gLog, Lines({"Bad parameter, 0 < nRuleConfOpRules=1, but rgRuleConfOpRules is NULL",
+                           "Bad parameter, 0 < nOpRules=1, but rgOpRules is NULL", "TAVOPFIsValidPortNo(0) failed",
+                           "ToPorts() failed", "WriteRouterRules() failed", "out of range, cRules=1 >= nRules=1"}));
+}
+
+TEST_F(Relay, StoredRulesThatCannotBeRead) {
+    const struct {
+        __tag_TAVO_ROUTER_RULE rule;
+        Lines lines;
+    } rgCases[] = {
+        {Stored("TCP", "1", "1", "", true), {"Bad parameter, szProtocol=TCP", "ToProtocolEnum([0]=-1) failed"}},
+        {Stored("tcp", "x", "1", "", true), {"invalid port no [x]", "TLibParsePorts(x) failed"}},
+        {Stored("tcp", "1", "2-", "", true), {"invalid port range [2-0]", "TLibParsePorts(2-) failed"}},
+    };
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        OPERATION_RULE* pOut = nullptr;
+        int nOut = 7;
+        EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, &c.rule, 1), -1);
+        EXPECT_EQ(gLog, c.lines);
+        EXPECT_EQ(pOut, nullptr);
+        EXPECT_EQ(nOut, 0);
+    }
+}
+
+// ---- the merge --------------------------------------------------------------------------------------------
+
+// "D tcp hop 80,443>80,443; E all - 5>5": disabled or enabled, protocol, service, router>box ports.
+struct Set : OperationRules {
+    explicit Set(const std::string& szRules) {
+        std::istringstream rules(szRules);
+        std::vector<__tag_TAVO_ROUTER_RULE> rgStored;
+        for (std::string szRule; std::getline(rules, szRule, ';');) {
+            std::istringstream fields(szRule);
+            std::string szEnable, szProtocol, szService, szPorts;
+            fields >> szEnable >> szProtocol >> szService >> szPorts;
+            const size_t nArrow = szPorts.find('>');
+            rgStored.push_back(Stored(szProtocol.c_str(), szPorts.substr(0, nArrow).c_str(),
+                                      szPorts.substr(nArrow + 1).c_str(), szService == "-" ? "" : szService.c_str(),
+                                      szEnable == "E"));
+        }
+        CreateOperationRulesArray(&rgRules, &nRules, rgStored.data(), static_cast<int>(rgStored.size()));
+    }
+    // What is not deleted, in the same form.
+    std::string Kept() const {
+        std::string szKept;
+        for (int i = 0; i < nRules; ++i) {
+            const OPERATION_RULE& rule = rgRules[i];
+            char szRouter[1024] = {};
+            char szBox[1024] = {};
+            if (rule.blDeleted || ToPorts(szRouter, 1024, *rule.routerPortSet) != 0 ||
+                ToPorts(szBox, 1024, *rule.boxPortSet) != 0) {
+                continue;
+            }
+            szKept += szKept.empty() ? "" : "; ";
+            szKept += rule.blEnable ? "E " : "D ";
+            szKept += ToProtocolString(rule.protocol) + std::string(" ") + szRouter + ">" + szBox;
+        }
+        return szKept;
+    }
+};
+
+TEST_F(Relay, WhoKeepsAPort) {
+    const struct {
+        const char* szWhat;
+        const char* szRequest;
+        const char* szConf;
+        const char* szRequestKept;
+        const char* szConfKept;
+        Lines lines;
+    } rgCases[] = {
+        {"the request replaces the service's enabled rules",
+         "E tcp hop 80>80",
+         "E tcp hop 80>81; E tcp hop 9>9",
+         "E tcp 80>80",
+         "",
+         {}},
+        {"the user's rule wins", "E tcp hop 80>80", "E tcp - 80>80", "", "E tcp 80>80", {}},
+        {"another service's too", "E udp hop 80-82>80-82", "E udp web 81>81", "E udp 80, 82>80, 82", "E udp 81>81", {}},
+        {"a user's disabled rule does not", "E tcp hop 80>80", "D tcp - 80>80", "E tcp 80>80", "D tcp 80>80", {}},
+        {"what is switched off stays off, as long as it is asked for",
+         "E tcp hop 443,8080>443,8080",
+         "D tcp hop 80,443>80,443",
+         "E tcp 8080>8080",
+         "D tcp 443>443",
+         {}},
+        {"nothing asked for", "", "D tcp hop 80>80; E tcp hop 81>81; E tcp - 5>6", "", "E tcp 5>6", {}},
+        {"a request for both passes by a tcp rule",
+         "E all hop 80>80",
+         "E tcp - 80>80",
+         "E all 80>80",
+         "E tcp 80>80",
+         {}},
+        {"a tcp request meets a rule for both", "E tcp hop 80>80", "E all - 80>80", "", "E all 80>80", {}},
+        {"another protocol", "E tcp hop 80>80", "E udp - 80>80", "E tcp 80>80", "E udp 80>80", {}},
+        {"the box port is taken",
+         "E tcp hop 80>80",
+         "E tcp - 8080>80",
+         "E tcp 80>80",
+         "E tcp 8080>80",
+         {"failed, port is partial matched", "DeletePortsFromRules1(C->A) failed"}},
+        {"the router port is taken",
+         "E tcp hop 80>80",
+         "E tcp - 80>8080",
+         "E tcp 80>80",
+         "E tcp 80>8080",
+         {"failed, port is partial matched", "DeletePortsFromRules1(C->A) failed"}},
+        {"both, but not as a pair",
+         "E tcp hop 80>80",
+         "E tcp - 80,81>81,80",
+         "E tcp 80>80",
+         "E tcp 80-81>81-80",
+         {"failed, port is partial matched", "DeletePortsFromRules1(C->A) failed"}},
+        {"what the service switched off is torn",
+         "E tcp hop 80>80",
+         "D tcp hop 81>80",
+         "E tcp 80>80",
+         "D tcp 81>80",
+         {"failed, port is partial matched", "DeletePortsFromRules1(B->C) failed"}},
+        {"the first rule decides",
+         "E tcp hop 80>80",
+         "E tcp - 80>80; E tcp - 80>81",
+         "",
+         "E tcp 80>80; E tcp 80>81",
+         {}},
+        {"what was removed before a failure stays removed",
+         "E tcp hop 79-80>79-80",
+         "E tcp - 80>80; E tcp - 79>1",
+         "E tcp 79>79",
+         "E tcp 80>80; E tcp 79>1",
+         {"failed, port is partial matched", "DeletePortsFromRules1(C->A) failed"}},
+        {"a rule whose sides differ",
+         "E tcp hop 80>80",
+         "D tcp hop 1,2>1",
+         "E tcp 80>80",
+         "D tcp 1-2>1",
+         {"begin, router port numbers=2 != box port numbers=1", "DeletePortsFromRules1(B->C) failed"}},
+    };
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        Set request(c.szRequest);
+        Set conf(c.szConf);
+        EXPECT_EQ(DeletePortsFromRuleConf(conf.rgRules, conf.nRules, "hop"), 0);
+        EXPECT_EQ(DeletePortsFromInputRules(request.rgRules, request.nRules, conf.rgRules, conf.nRules, "hop"),
+                  c.lines.empty() ? 0 : -1)
+            << c.szWhat;
+        EXPECT_EQ(request.Kept(), c.szRequestKept) << c.szWhat;
+        EXPECT_EQ(conf.Kept(), c.szConfKept) << c.szWhat;
+        EXPECT_EQ(gLog, c.lines) << c.szWhat;
+    }
+    EXPECT_EQ(DeletePortsFromRuleConf(nullptr, 0, ""), -1);
+    EXPECT_TRUE(Logged("Bad parameter, szServiceName shall not be empty"));
+}
+
+TEST_F(Relay, RefusedArgumentsOfAPass) {
+    OPERATION_RULE rule = {};
+    const struct {
+        int nRules1;
+        OPERATION_RULE* pRules1;
+        int nRules;
+        const char* szLine;
+    } rgCases[] = {
+        {-1, &rule, 0, "Bad parameter, 0 > nOpRules1=-1"},
+        {1, nullptr, 0, "Bad parameter, 0 < nOpRules1=1, but rgOpRules1 is NULL"},
+        {0, nullptr, -2, "Bad parameter, 0 > nOpRules=-2"},
+        {0, nullptr, 2, "Bad parameter, 0 < nOpRules=2, but rgOpRules is NULL"},
+    };
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        EXPECT_EQ(DeletePortsFromRules1(c.pRules1, c.nRules1, nullptr, c.nRules, true, nullptr, nullptr), -1);
+        EXPECT_EQ(gLog, Lines({c.szLine}));
+    }
+    gLog.clear();
+    EXPECT_EQ(DeletePortsFromRules1(nullptr, 0, nullptr, 0, true, nullptr, nullptr), 0);
+    EXPECT_TRUE(gLog.empty());
+}
+
+// Rules of a few ports out of a few, so that everything overlaps; broken ones and odd protocols among them.
+class RandomRules {
+public:
+    explicit RandomRules(unsigned nSeed) : mEngine(nSeed) {}
+
+    bool OneIn(int n) { return Below(n) == 0; }
+    int Below(int n) { return static_cast<int>(mEngine() % static_cast<unsigned>(n)); }
+    RULE_FILTER Filter() { return {OneIn(3) ? nullptr : Name(), OneIn(2), !OneIn(3), !OneIn(3)}; }
+    void Fill(OperationRules& one, OperationRules& copy) {
+        one.nRules = copy.nRules = Below(5);
+        const auto nRoom = static_cast<size_t>(one.nRules + 1);
+        one.rgRules = static_cast<OPERATION_RULE*>(calloc(nRoom, sizeof(OPERATION_RULE)));
+        copy.rgRules = static_cast<OPERATION_RULE*>(calloc(nRoom, sizeof(OPERATION_RULE)));
+        const bool blPairs = OneIn(2);  // the same port on both sides: few partial matches
+        for (int i = 0; i < one.nRules; ++i) {
+            OPERATION_RULE& rule = one.rgRules[i];
+            rule.blEnable = OneIn(2);
+            rule.blDeleted = OneIn(8);
+            rule.protocol = static_cast<PORTMAP_PROTOCOL>(OneIn(20) ? 7 : Below(3));
+            FillText(rule.szServiceName, Name());
+            const int nPorts = OneIn(30) ? 0 : 1 + Below(6);
+            rule.routerPortSet = OneIn(40) ? nullptr : Ports(nPorts);
+            rule.boxPortSet = OneIn(40) ? nullptr : Ports(OneIn(30) ? nPorts + 1 : nPorts);
+            if (blPairs && rule.boxPortSet != nullptr && rule.routerPortSet != nullptr) {
+                *rule.boxPortSet = *rule.routerPortSet;
+            }
+            copy.rgRules[i] = rule;
+            copy.rgRules[i].routerPortSet = rule.routerPortSet == nullptr ? nullptr : new PortList(*rule.routerPortSet);
+            copy.rgRules[i].boxPortSet = rule.boxPortSet == nullptr ? nullptr : new PortList(*rule.boxPortSet);
+        }
+    }
+
+private:
+    const char* Name() { return OneIn(2) ? "hop" : ""; }
+    PortList* Ports(int nPorts) {
+        auto pPorts = std::make_unique<PortList>();
+        for (int i = 0; i < nPorts; ++i) {
+            pPorts->push_back(OneIn(200) ? 0 : 1 + Below(8) + (OneIn(4) ? 65527 : 0));
+        }
+        return pPorts.release();
+    }
+
+    std::mt19937 mEngine;
+};
+
+bool SameLists(const PortList* pOne, const PortList* pOther) {
+    return pOne == nullptr || pOther == nullptr ? pOne == pOther : *pOne == *pOther;
+}
+
+TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
+    std::map<std::string, int> seen;
+    for (unsigned nSeed = 1; nSeed <= 40000; ++nSeed) {
+        RandomRules random(nSeed);
+        OperationRules rules1, rules1Copy, rules, rulesCopy;
+        random.Fill(rules1, rules1Copy);
+        random.Fill(rules, rulesCopy);
+        const RULE_FILTER filter1 = random.Filter();
+        const RULE_FILTER filter2 = random.Filter();
+        const RULE_FILTER* pFilter1 = random.OneIn(3) ? nullptr : &filter1;
+        const RULE_FILTER* pFilter2 = random.OneIn(3) ? nullptr : &filter2;
+        const bool blDeleteFound = random.OneIn(2);
+        gLog.clear();
+        const int nExpected = naive::DeletePortsFromRules1(rules1Copy.rgRules, rules1Copy.nRules, rulesCopy.rgRules,
+                                                           rulesCopy.nRules, blDeleteFound, pFilter1, pFilter2);
+        const Lines expected = gLog;
+        gLog.clear();
+        ASSERT_EQ(tavo::lib::DeletePortsFromRules1(rules1.rgRules, rules1.nRules, rules.rgRules, rules.nRules,
+                                                   blDeleteFound, pFilter1, pFilter2),
+                  nExpected)
+            << nSeed;
+        ASSERT_EQ(gLog, expected) << nSeed;
+        for (int i = 0; i < rules1.nRules; ++i) {
+            const OPERATION_RULE& one = rules1.rgRules[i];
+            const OPERATION_RULE& other = rules1Copy.rgRules[i];
+            ASSERT_EQ(one.blDeleted, other.blDeleted) << nSeed;
+            ASSERT_TRUE(SameLists(one.routerPortSet, other.routerPortSet)) << nSeed;
+            ASSERT_TRUE(SameLists(one.boxPortSet, other.boxPortSet)) << nSeed;
+        }
+        const std::string szLine = expected.empty() ? "success" : expected[0].substr(0, 24);
+        ++seen[szLine];
+    }
+    // Every outcome has been met, often enough to mean something.
+    for (const auto& [szLine, nTimes] : seen) {
+        EXPECT_GT(nTimes, 20) << szLine;
+    }
+    EXPECT_GT(seen["success"], 4000);
+    EXPECT_GE(seen.size(), 8U);
+}
+
+}  // namespace
