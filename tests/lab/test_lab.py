@@ -61,6 +61,12 @@ class RealRouter(unittest.TestCase):
         self.assertIn("0x13100022 The router already uses these ports for something else: 5001/tcp",
                       LAB.read("/var/log/tavo/event.log"))
 
+    def test_of_two_rules_for_a_port_the_second_is_reported_unless_it_asks_for_the_same(self):
+        answer = LAB.save("1,1,tcp,5001,5001", "2,1,all,5001,5002", "3,1,tcp,5001,5001", "4,0,tcp,5001,5003")
+        self.assertEqual((answer["status"], answer["ports"]), (9, "5001/tcp (service 2)"))
+        self.assertEqual(LAB.status()["5001/tcp (service 2)"], "duplicate")
+        self.assertEqual(LAB.mappings(), {("tcp", 5001): (BOX, 5001), ("udp", 5001): (BOX, 5002)})
+
     def test_rules_that_cannot_be_paired_are_reported_and_the_others_mapped(self):
         answer = LAB.save("1,1,tcp,5001-5003,5001-5002", "2,1,tcp,5004,5004", "3,1,tcp,99999,1")
         self.assertEqual((answer["status"], answer["ports"]), (9, "5001-5003/tcp, 99999/tcp"))

@@ -135,9 +135,7 @@ int RuleMapper::SecondsToNext(const PassResult& result) {
 }
 
 void RuleMapper::WriteResults(PassResult result) const {
-    for (const std::string& szRule : mWanted.rgszInvalid) {
-        result.rgStatus.emplace_back(szRule, "invalid");
-    }
+    result.rgStatus.insert(result.rgStatus.end(), mWanted.rgRefused.begin(), mWanted.rgRefused.end());
     if (!mWanted.blReadable) {
         result.rgStatus.emplace_back("rule.conf", "unreadable");
     }

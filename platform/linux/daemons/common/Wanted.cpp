@@ -3,8 +3,8 @@
 #include "daemons/common/Wanted.h"
 
 #include <cstring>
+#include <map>
 #include <memory>
-#include <set>
 
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
@@ -18,6 +18,36 @@ constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 constexpr size_t kMaxDescription = 60;
 constexpr size_t kMaxRuleText = 200;
 
+// Nothing that separates keys from values, or starts a comment, in a key file.
+std::string KeyText(const std::string& szText) {
+    std::string szKey = PrintableText(szText, kMaxRuleText);
+    for (char& c : szKey) {
+        c = c == '=' || c == '#' ? '_' : c;
+    }
+    return szKey;
+}
+
+// "5000/tcp (web)": the port as the one rule asks for it, beside "5000/tcp", which another rule has.
+std::string DuplicateName(const RouterMapping& mapping, const TAVO_PF_CONF* pRule) {
+    const std::string szService = Value(pRule, "service");
+    return KeyText(MappingName(mapping) + " (" + (szService.empty() ? pRule->szSection : szService) + ")");
+}
+
+// Takes a rule's single mappings in; the first rule that asks for a port has it.
+void AddRule(const TAVO_PF_CONF* pRule, const std::vector<SingleMapping>& rgSingles,
+             std::map<std::string, uint16_t>& mapBoxPorts, WantedSet& wanted) {
+    for (const SingleMapping& single : rgSingles) {
+        RouterMapping mapping{
+            single.szProtocol, single.nRouterPort, single.nBoxPort, "", MappingDescription(pRule), 0, true};
+        const auto [it, blNew] = mapBoxPorts.try_emplace(MappingName(mapping), mapping.nBoxPort);
+        if (blNew) {
+            wanted.rgMappings.push_back(std::move(mapping));
+        } else if (it->second != mapping.nBoxPort) {
+            wanted.rgRefused.emplace_back(DuplicateName(mapping, pRule), "duplicate");
+        }
+    }
+}
+
 }  // namespace
 
 std::string MappingDescription(const TAVO_PF_CONF* pRule) {
@@ -30,11 +60,7 @@ std::string MappingDescription(const TAVO_PF_CONF* pRule) {
 }
 
 std::string RuleName(const TAVO_PF_CONF* pRule) {
-    std::string szName = PrintableText(Value(pRule, "r_port") + "/" + Value(pRule, "protocol name"), kMaxRuleText);
-    for (char& c : szName) {
-        c = c == '=' || c == '#' ? '_' : c;
-    }
-    return szName;
+    return KeyText(Value(pRule, "r_port") + "/" + Value(pRule, "protocol name"));
 }
 
 bool IsRunKeyOn(const char* szRunKey) {
@@ -51,24 +77,17 @@ WantedSet ReadWanted(const char* szRunKey) {
     const ConfList pRules(TAVOPFRuleGet());
     wanted.blReadable =
         pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCFileExist("/etc/portforward/rule.conf") == 0;
-    std::set<std::string> setNames;
+    std::map<std::string, uint16_t> mapBoxPorts;
     for (const TAVO_PF_CONF* pRule = pRules.get(); pRule != nullptr; pRule = pRule->pNext) {
         if (Value(pRule, "enabled") != "1") {
             continue;
         }
         const auto rgSingles =
             ExpandRule(Value(pRule, "protocol name"), Value(pRule, "r_port"), Value(pRule, "s_port"));
-        if (!rgSingles) {
-            wanted.rgszInvalid.push_back(RuleName(pRule));
-            continue;
-        }
-        for (const SingleMapping& single : *rgSingles) {
-            RouterMapping mapping{
-                single.szProtocol, single.nRouterPort, single.nBoxPort, "", MappingDescription(pRule), 0, true};
-            // The first rule that asks for a port has it.
-            if (setNames.insert(MappingName(mapping)).second) {
-                wanted.rgMappings.push_back(std::move(mapping));
-            }
+        if (rgSingles) {
+            AddRule(pRule, *rgSingles, mapBoxPorts, wanted);
+        } else {
+            wanted.rgRefused.emplace_back(RuleName(pRule), "invalid");
         }
     }
     return wanted;

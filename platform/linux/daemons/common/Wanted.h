@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "daemons/common/Pass.h"
 #include "tavo/portforward.h"
 #include "upnp/Router.h"
 
@@ -13,7 +14,9 @@ namespace tavo {
 
 struct WantedSet {
     std::vector<RouterMapping> rgMappings;  // client and lease still to be filled
-    std::vector<std::string> rgszInvalid;   // rules whose ports cannot be paired, as text for a user
+    // What no router is asked for, as text for a user: rules whose ports cannot be paired ("invalid"), and
+    // ports that an earlier rule sends to another port of the box ("duplicate").
+    StatusList rgRefused;
     bool blReadable = true;
 };
 
