@@ -45,6 +45,9 @@ table inet home {
 }
 """
 
+WEB_MODELS = {"form": ("Alderman", "Homestead 2", "1.0"), "json": ("Brightwater", "R300", "2.1"),
+              "blind": ("Cobbler", "Gate", "7.3")}  # 7.3 has no description of its own
+WEB_PASSWORD = r'p&ss=1\"\\{user}%0d\r\n'  # as a settings file holds it
 AVAHI = "/usr/sbin/avahi-daemon --no-drop-root --no-chroot --no-rlimits --no-proc-title"
 AVAHI_CONF = """
 [server]
@@ -136,7 +139,8 @@ class Lab:
                           "/usr/tavo/bin", "/etc/tavo"):
             os.makedirs(directory, exist_ok=True)
         for source, target in (("platform/linux/daemons/upnpd", "/usr/tavo/sbin/upnpd"),
-                               ("platform/linux/daemons/tavoairportd", "/usr/tavo/sbin/tavoairportd")):
+                               ("platform/linux/daemons/tavoairportd", "/usr/tavo/sbin/tavoairportd"),
+                               ("platform/linux/daemons/tavoportforward", "/usr/tavo/bin/tavoportforward")):
             if os.path.lexists(target):
                 os.unlink(target)
             os.symlink(f"{BUILD}/{source}", target)
@@ -238,6 +242,34 @@ class Lab:
 
     def map_foreign(self, port, protocol="TCP"):
         self.run("lan2", f"upnpc -a {LAN2} {port} {port} {protocol}")
+
+    # ---- a router with web pages only --------------------------------------------------------------------
+
+    def start_web(self, flavour, fault="none", tls=False, model=None):
+        """The scripted web router, and its settings and description on the box."""
+        brand, name, version = model or WEB_MODELS[flavour]
+        shutil.rmtree("/etc.defaults/portforward/routerdb", ignore_errors=True)
+        shutil.copytree(f"{HERE}/../../packaging/routerdb", "/etc.defaults/portforward/routerdb")
+        certificate = []
+        if tls:
+            certificate = ["/tmp/router.pem"]
+            sh("openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj /CN=router -keyout /tmp/router.pem "
+               "-out /tmp/router.crt && cat /tmp/router.crt >>/tmp/router.pem")
+        self.write("/etc/portforward/router.conf",
+                   f'[{GATEWAY}]\nbrand="{brand}"\nmodel="{name}"\nversion="{version}"\nsupport_router_upnp="no"\n'
+                   f'support_router_natpmp="no"\nuser="admin"\npass="{WEB_PASSWORD}"\n'
+                   f'conn_type="{"https" if tls else "http"}"\nconn_port="8080"\n')
+        self.router = self.start("router", "/usr/bin/python3", f"{HERE}/web_router.py", flavour, fault, "8080",
+                                 *certificate, stderr=subprocess.DEVNULL)
+        return wait_for(self.web_state, 10, "the web router is up")
+
+    def web_state(self):
+        """Its table and how often each page was asked for."""
+        for scheme in ("http", "https"):
+            out = self.run("box", f"curl -sk -m 5 {scheme}://{GATEWAY}:8080/state", check=False).stdout
+            if out:
+                return json.loads(out)
+        return None
 
     # ---- avahi ------------------------------------------------------------------------------------------
 

@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "core/Export.h"
 #include "core/TextFile.h"
 #include "tavo/portforward.h"
 
@@ -24,6 +25,6 @@ inline std::string Value(const TAVO_PF_CONF* pConf, const char* szKey) {
 // Null for no sections; throws std::bad_alloc.
 ConfList MakeConfList(const std::vector<Section>& rgSections);
 // All sections of a sectioned file. Null: missing or unparsable, or (last error none) no section in it.
-ConfList LoadConfList(const char* szPath);
+TAVO_PLATFORM_API ConfList LoadConfList(const char* szPath);
 
 }  // namespace tavo

@@ -1,0 +1,52 @@
+// The rules as jobs for a manual router's pages: one for each single router port, one for each range.
+// Relies on the rule file and on the description of the router's pages. Promises: never more jobs than the
+// capacity check counted; a rule that the pages cannot take is named with the reason.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "tavo/portforward.h"
+
+namespace tavo {
+
+struct Job {
+    std::string szProtocol;  // "tcp", "udp" or "both"
+    uint16_t nRouterFirst = 0;
+    uint16_t nRouterLast = 0;
+    uint16_t nBoxFirst = 0;
+    std::string szName;  // as MappingDescription() makes it
+
+    bool IsRange() const { return nRouterFirst != nRouterLast; }
+    uint16_t BoxLast() const { return static_cast<uint16_t>(nBoxFirst + (nRouterLast - nRouterFirst)); }
+    // "5000-5010/tcp", as a user reads it.
+    std::string Text() const;
+    // Whether both are the same forward; the names do not count.
+    bool IsSame(const Job& other) const { return HasSamePlace(other) && nBoxFirst == other.nBoxFirst; }
+    // Whether both are the router's entry for the same ports and protocol.
+    bool HasSamePlace(const Job& other) const {
+        return szProtocol == other.szProtocol && nRouterFirst == other.nRouterFirst && nRouterLast == other.nRouterLast;
+    }
+    // Whether one router cannot hold both.
+    bool Clashes(const Job& other) const {
+        return nRouterFirst <= other.nRouterLast && other.nRouterFirst <= nRouterLast &&
+               (szProtocol == other.szProtocol || szProtocol == "both" || other.szProtocol == "both");
+    }
+};
+
+struct Refusal {
+    std::string szWhat;  // job or rule as a user reads it
+    std::string szWhy;
+};
+
+struct JobSet {
+    std::vector<Job> rgJobs;
+    std::vector<Refusal> rgRefusals;
+    bool blReadable = true;  // false: the rule file could not be read, so nothing is known of what it asks
+};
+
+// The jobs of the enabled rules; pDescription: the sections that describe the router's pages.
+JobSet ReadJobs(const TAVO_PF_CONF* pDescription);
+
+}  // namespace tavo

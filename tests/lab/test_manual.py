@@ -1,0 +1,145 @@
+"""Routers that have web pages only: rules saved on the box, a stranger outside, and pages with faults."""
+import os
+import signal
+import time
+import unittest
+
+from homelab import BOX, LAN2, run_tests, wait_for
+
+LAB = None
+TOOL = "/usr/tavo/bin/tavoportforward"
+EVENTS = "/var/log/tavo/event.log"
+FOREIGN = {("tcp", 9999): (LAN2, 9999)}
+
+
+def events():
+    return LAB.read(EVENTS) if os.path.exists(EVENTS) else ""
+
+
+class Manual(unittest.TestCase):
+    def setUp(self):
+        LAB.install()
+        self.forget()
+
+    def tearDown(self):
+        LAB.stop_router()
+
+    @staticmethod
+    def forget():
+        for path in (EVENTS, "/etc/portforward/rule.conf", "/var/lib/tavo/manual_router.made"):
+            if os.path.exists(path):
+                os.unlink(path)
+
+    def forwards(self):
+        """The router's table without the other box's line, as single forwards."""
+        return {(protocol, row["first"] + i): (row["host"], row["port"] + i) for row in LAB.web_state()["table"]
+                for protocol in (("tcp", "udp") if row["protocol"] == "both" else (row["protocol"],))
+                for i in range(row["last"] - row["first"] + 1)}
+
+    def saved(self, wanted, *rules):
+        answer = LAB.save(*rules)
+        self.assertEqual((answer["result"], answer["status"], events()), (0, 0, ""))
+        self.assertEqual(self.forwards(), {**wanted, **FOREIGN})
+        self.assertEqual(LAB.mappings(), self.forwards())
+
+    def test_saves_in_a_row(self):
+        single = {("tcp", 5001): (BOX, 5001), ("udp", 5001): (BOX, 5001)}
+        other = {("tcp", 5001): (BOX, 5002)}
+        span = {("tcp", port): (BOX, port - 1000) for port in (6001, 6002, 6003)}
+        table = (("form", False, [(single, "1,1,all,5001,5001"), ({**other, **span}, "1,1,tcp,5001,5002",
+                                                                  "2,1,tcp,6001-6003,5001-5003", "3,0,tcp,7001,5001")]),
+                 ("json", False, [(single, "1,1,all,5001,5001"), (other, "1,1,tcp,5001,5002")]),
+                 ("blind", True, [(single, "1,1,all,5001,5001"), ({("udp", 5003): (BOX, 5003)}, "1,1,udp,5003,5003")]))
+        for flavour, tls, saves in table:
+            with self.subTest(flavour=flavour):
+                self.forget()
+                LAB.start_web(flavour, tls=tls)
+                for wanted, *rules in saves + saves[-1:] + [({}, )]:
+                    self.saved(wanted, *rules)
+                    for probe in (("tcp", 5001), ("udp", 5001), ("tcp", 6002), ("udp", 5003)):
+                        self.assertEqual(LAB.reaches(*probe), probe in wanted, probe)
+                LAB.stop_router()
+
+    def test_an_unchanged_set_is_only_looked_at(self):
+        LAB.start_web("form")
+        self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+        before = LAB.web_state()["count"]
+        self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+        after = LAB.web_state()["count"]
+        self.assertEqual((after["/forward.cgi"], after["/apply.cgi"]), (before["/forward.cgi"], before["/apply.cgi"]))
+
+    def test_what_the_router_does_not_take(self):
+        LAB.start_web("form")
+        LAB.save("1,1,tcp,9999,5001", "2,1,tcp,5001,5001")
+        self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
+        self.assertIn("9999/tcp (the router already forwards this port for something else)", events())
+        LAB.stop_router()
+        LAB.start_web("blind")
+        LAB.save("1,1,tcp,5001,5002", "2,1,tcp,9999,9999")
+        self.assertEqual(self.forwards(), FOREIGN)
+        self.assertIn("5001/tcp (the router cannot forward to another port number)", events())
+        self.assertIn("9999/tcp (the router refused it)", events())
+        LAB.save()
+        self.assertEqual(self.forwards(), FOREIGN, "a refused forward is not taken for ours")
+
+    def test_faults(self):
+        """Fault: flavour, what the user learns, and a bound in seconds."""
+        table = (("changed", "form", 'gave no "token"', 3), ("hangs", "form", "did not answer in time", 13),
+                 ("hangs_on_add", "form", "did not answer in time", 13), ("endless", "blind", "too long", 5),
+                 ("redirects", "blind", "answered with status 302", 3),
+                 ("lies", "form", "said yes but does not list it", 5), ("lies", "json", "said yes but", 5))
+        for fault, flavour, why, seconds in table:
+            with self.subTest(fault=fault, flavour=flavour):
+                self.forget()
+                LAB.start_web(flavour, fault)
+                start = time.monotonic()
+                self.assertEqual(LAB.save("1,1,tcp,5001,5001", seconds=seconds + 5)["result"], 0)
+                self.assertLess(time.monotonic() - start, seconds)
+                self.assertIn("ports: 5001/tcp (", events())
+                self.assertIn(why, events())
+                self.assertGreater(len(LAB.web_state()["count"]), 1, "the fault was reached")
+                self.assertEqual(self.forwards(), FOREIGN)
+                LAB.stop_router()
+
+    def test_wrong_password_is_tried_once(self):
+        LAB.start_web("form")
+        conf = LAB.read("/etc/portforward/router.conf")
+        LAB.write("/etc/portforward/router.conf", conf.replace("p&ss", "wrong"))
+        LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")
+        self.assertIn("5001/tcp, 5002/tcp (the router does not accept the user name or the password)", events())
+        self.assertEqual(LAB.web_state()["count"]["/login.cgi"], 1)
+        self.assertNotIn("wrong=1", events())
+
+    def test_values_stay_in_their_place(self):
+        hostile = 'x&action=delete&id=1</td>"\\\\{pass}%0d%0a'
+        for flavour in ("form", "json", "blind"):
+            with self.subTest(flavour=flavour):
+                self.forget()
+                LAB.start_web(flavour)
+                LAB.write("/etc/portforward/rule.conf", '[1]\nenabled="1"\nservice="' + hostile.replace('"', '\\"') +
+                          '"\nprotocol name="tcp"\nr_port="5001"\ns_port="5001"\n')
+                self.assertEqual(LAB.run("box", TOOL, check=False).returncode, 0)
+                rows = [row for row in LAB.web_state()["table"] if row["host"] == BOX]
+                self.assertEqual([row["name"] for row in rows], [("tavo:" + hostile.replace("\\\\", "\\"))[:31]])
+                self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
+                LAB.stop_router()
+
+    def test_killed_in_the_middle_forgets_nothing(self):
+        LAB.start_web("blind", "hangs_after_add")
+        LAB.write("/etc/portforward/rule.conf",
+                  '[1]\nenabled="1"\nprotocol name="tcp"\nr_port="5001"\ns_port="5001"\n')
+        tool = LAB.start("box", TOOL)
+        wait_for(lambda: ("tcp", 5001) in self.forwards(), 10, "the router has done it")
+        tool.send_signal(signal.SIGKILL)
+        tool.wait()
+        self.saved({})
+
+
+def prepare(lab):
+    global LAB
+    LAB = lab
+    lab.serve(5001, 5002, 5003)
+
+
+if __name__ == "__main__":
+    run_tests(prepare)
