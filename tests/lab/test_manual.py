@@ -4,7 +4,7 @@ import signal
 import time
 import unittest
 
-from homelab import BOX, LAN2, run_tests, wait_for
+from homelab import BOX, HERE, LAN2, run_tests, wait_for
 
 LAB = None
 TOOL = "/usr/tavo/bin/tavoportforward"
@@ -100,6 +100,29 @@ class Manual(unittest.TestCase):
                 self.assertGreater(len(LAB.web_state()["count"]), 1, "the fault was reached")
                 self.assertEqual(self.forwards(), FOREIGN)
                 LAB.stop_router()
+
+    def test_operations_that_cannot_be_performed(self):
+        good = "[PF add port]\npath=/a\n[PF delete port]\npath=/d\n"
+        table = (("[login]\nform=x\n" + good, "[login] has no path"), (good + "sleep=1\n", '"sleep" of [PF delete port]'),
+                 ("[global]\nsyntax version=2\n" + good, '"syntax version" of [global]'),
+                 ("[PF add port]\npath=/a\n", "[PF delete port] is missing"), (good + "[PF lst]\npath=/l\n", "[PF lst]"),
+                 (good + "path=http://192.168.77.3/\n", '"path" of'), (good + "take x=([0-9\n", '"take x" of'),
+                 (good + "header X: y=z\n", '"header X: y" of'), ("no sections\n", "no sectioned file"))
+        for text, why in table:
+            with self.subTest(text=text):
+                LAB.write("/tmp/router.ops", text)
+                out = LAB.run("box", f"{TOOL} --check /tmp/router.ops", check=False)
+                self.assertEqual((out.returncode, why in out.stdout), (1, True), out.stdout)
+        samples = f"find {HERE}/../../packaging/routerdb -name router.ops -exec {TOOL} --check {{}} +"
+        self.assertEqual(LAB.run("box", samples).stdout, "")
+
+    def test_an_expression_that_would_never_end(self):
+        LAB.start_web("form")
+        path = "/etc.defaults/portforward/routerdb/Alderman/Homestead 2/1.0/router.ops"
+        LAB.write(path, LAB.read(path).replace("entry=", "entry=(?:[^!]+[^!]+)+!"))
+        LAB.save("1,1,tcp,5001,5001", seconds=5)
+        self.assertIn("cannot be searched", events())
+        self.assertEqual(self.forwards(), FOREIGN)
 
     def test_wrong_password_is_tried_once(self):
         LAB.start_web("form")
