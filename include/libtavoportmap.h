@@ -31,29 +31,31 @@
 
 #ifdef __cplusplus
 #define TAVO_LAYOUT static_assert
+#define TAVO_ENUM_INT : int /* any value that a caller hands in is a value of the enum */
 extern "C" {
 #else
 #define TAVO_LAYOUT _Static_assert
+#define TAVO_ENUM_INT
 #endif
 
 /* ---- enums; the values are fixed, a record stores them in four bytes ---------------------------- */
 
 /* Whether the router supports a protocol; as text "no", "yes", "unknown". */
-typedef enum __tag_TAVO_ROUTER_SUPPORT {
+typedef enum __tag_TAVO_ROUTER_SUPPORT TAVO_ENUM_INT {
     TAVO_ROUTER_SUPPORT_NO = 0,
     TAVO_ROUTER_SUPPORT_YES = 1,
     TAVO_ROUTER_SUPPORT_UNKNOWN = 2
 } __tag_TAVO_ROUTER_SUPPORT;
 
 /* What the library is busy with. */
-typedef enum __tag_TAVO_LIBTAVOPORTMAP_TASK {
+typedef enum __tag_TAVO_LIBTAVOPORTMAP_TASK TAVO_ENUM_INT {
     TAVO_LIBTAVOPORTMAP_TASK_IDLE = 0,
     TAVO_LIBTAVOPORTMAP_TASK_TESTING = 1, /* a UPnP compatibility test */
     TAVO_LIBTAVOPORTMAP_TASK_SAVING = 2   /* rules are being saved to the router */
 } __tag_TAVO_LIBTAVOPORTMAP_TASK;
 
 /* Why a getter or setter failed; look at the return value first. */
-typedef enum __tag_TAVO_LIBTAVOPORTMAP_ERR {
+typedef enum __tag_TAVO_LIBTAVOPORTMAP_ERR TAVO_ENUM_INT {
     TAVO_LIBTAVOPORTMAP_ERR_NONE = 0,
     TAVO_LIBTAVOPORTMAP_ERR_FAILED = 1,
     TAVO_LIBTAVOPORTMAP_ERR_CONFLICT = 2,      /* another operation holds the router lock */
@@ -63,7 +65,7 @@ typedef enum __tag_TAVO_LIBTAVOPORTMAP_ERR {
 } __tag_TAVO_LIBTAVOPORTMAP_ERR;
 
 /* What is known of the gateway; as text "unknown", "not_initialized", "upnp_natpmp", "manual". */
-typedef enum __TAG_TAVO_ROUTER_INIT_STATE {
+typedef enum __TAG_TAVO_ROUTER_INIT_STATE TAVO_ENUM_INT {
     TAVO_ROUTER_INIT_STATE_UNKNOWN = 0,
     TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED = 1,
     TAVO_ROUTER_INIT_STATE_UPNP_NATPMP = 2,
@@ -166,8 +168,8 @@ TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT) == 8 + 1024, "save layout
 
 /* Progress and outcome of the UPnP compatibility test. */
 typedef struct __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT {
-    int nProgress;
-    int nStatus;
+    int nProgress; /* percent: 10, 20, 30, 60, 40, 50, 70, 80, 90, 100 */
+    int nStatus;   /* 2 locked, 13 no UPnP gateway; 14 to 20, the failed step, only for a router without a name */
     char szBrand[TAVO_TEXT_SIZE];
     char szModel[TAVO_TEXT_SIZE];
     char szVersion[TAVO_TEXT_SIZE];
@@ -260,8 +262,9 @@ TAVO_API int IGetCurrSyntaxVersion(void);
 TAVO_API int TLibGetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf,
                                __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
 /* Makes the record the only section of router.conf, named by the current gateway. Account and connection
- * are stored for a manual router only (neither support word is "yes"), szMaxRule never. 0 or -1; after a
- * failure the settings are as they were. pErr may be NULL: 1, also after success; 2: the lock was held;
+ * are stored for a manual router only (neither support word is "yes"), szMaxRule never. 0 or -1; a
+ * failure leaves a manual router's settings as they were, and no settings where the write of another
+ * router's failed. pErr may be NULL: 1, also after success; 2: the lock was held;
  * 6: the router's description is newer than the port-forward tool. */
 TAVO_API int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf,
                                __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
@@ -531,8 +534,10 @@ private:
 };
 
 /* Where the answer of the last detection is cached, and the key that holds the router's state. */
+extern "C" {
 TAVO_API extern const std::string SZF_DETECT_MANUAL_CACHE;
 TAVO_API extern const std::string SZ_ROUER_INIT;
+}
 
 namespace DetectCache {
 /* "unknown", "not_initialized", "upnp_natpmp", "manual"; empty for another value. */
@@ -664,4 +669,5 @@ public:
 #endif /* __cplusplus */
 
 #undef TAVO_LAYOUT
+#undef TAVO_ENUM_INT
 #endif /* LIBTAVOPORTMAP_H */

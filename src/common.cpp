@@ -17,6 +17,7 @@
 #include <cstring>
 
 #include "tavo/net.h"
+#include "tavo/task.h"
 
 namespace {
 
@@ -24,6 +25,7 @@ constexpr char kFile[] = "src/common.cpp";
 
 using tavo::lib::LogError;
 
+constexpr char kKeyLineFormat[] = "%s=\"%s\"\n";
 constexpr int kLockFileMode = 0600;
 constexpr size_t kAddressSize = 16;
 constexpr size_t kBrandSize = 512;
@@ -172,6 +174,34 @@ void LogError(const char* szFormat, ...) {
     errno = nErrno;
 }
 
+void FileLock::LeaveToParent() {
+    if (mFd >= 0) {
+        close(mFd);
+    }
+    mFd = -1;
+}
+
+bool SetRunKey(const char* szKey, const char* szValue) {
+    return TLIBCFileSetKeyValue(kSystemConf, szKey, szValue, kKeyLineFormat) >= 0;
+}
+
+TaskUpdate::TaskUpdate(NOS::Task& task) : mTask(task) {
+    mTask.remove();
+    mTask.beginUpdate();
+}
+
+TaskUpdate::~TaskUpdate() {
+    mTask.endUpdate();
+}
+
+std::string TaskText(const char* szId, const char* szName) {
+    return AtBorder(std::string(), [&] {
+        NOS::Task task(kTaskOwner, szId);
+        task.reload();
+        return task.getStringProperty(szName, "");
+    });
+}
+
 int ToInt(const char* szText) {
     return static_cast<int>(std::clamp(std::strtol(szText, nullptr, 10), long{INT_MIN}, long{INT_MAX}));
 }
@@ -192,13 +222,18 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
     return pNode;
 }
 
-bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
-    std::string szAside = std::string(szPath) + "XXXXXX";
+std::string UniqueName(const char* szPath) {
+    std::string szName = std::string(szPath) + "XXXXXX";
     // The name is only ever renamed to, never opened, and its directory is root's own.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
-    mktemp(szAside.data());
+    mktemp(szName.data());
 #pragma GCC diagnostic pop
+    return szName;
+}
+
+bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
+    const std::string szAside = UniqueName(szPath);
     if (TLIBCFileExist(szPath) == 1 && rename(szPath, szAside.c_str()) != 0) {
         LogError("%s:%d rename(%s, %s) failed ", kFile, __LINE__, szPath, szAside.c_str());
         if (TLIBCFileExist(szAside.c_str()) == 1) {

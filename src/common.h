@@ -14,6 +14,10 @@
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 
+namespace NOS {
+class Task;
+}
+
 namespace tavo::lib {
 
 inline constexpr char kRouterLock[] = "/tmp/routerconf.lock";
@@ -23,6 +27,9 @@ inline constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 inline constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 inline constexpr char kRouterDbDir[] = "/etc.defaults/portforward/routerdb";
 inline constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
+inline constexpr char kUpnpRunKey[] = "runupnpportmapping";
+inline constexpr char kNatpmpRunKey[] = "runnatpmpportmapping";
+inline constexpr char kTaskOwner[] = "@system";
 inline constexpr char kUpnpTestDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";
 inline constexpr char kUpnpd[] = "upnpd";
 inline constexpr char kNatpmpd[] = "natpmpd";
@@ -56,24 +63,50 @@ Result AtBorder(Result failure, Function fnAnswer) noexcept {
     }
 }
 
-// The router lock for one call. Get() tries it without waiting; it is released with the object, also
-// when it was held elsewhere and only a descriptor was opened.
-class RouterLock {
+// A lock file for one call. Get() tries it without waiting; it is released with the object, also when it
+// was held elsewhere and only a descriptor was opened.
+class FileLock {
 public:
-    RouterLock() = default;
-    ~RouterLock() { Release(); }
-    RouterLock(const RouterLock&) = delete;
-    RouterLock& operator=(const RouterLock&) = delete;
+    explicit FileLock(const char* szPath) : mSzPath(szPath) {}
+    ~FileLock() { Release(); }
+    FileLock(const FileLock&) = delete;
+    FileLock& operator=(const FileLock&) = delete;
 
-    bool Get() { return lock_file(kRouterLock, mFd) != 0; }
+    bool Get() { return lock_file(mSzPath, mFd) != 0; }
     void Release() {
         unlock_file(mFd);
         mFd = -1;
     }
+    // In a forked child: gives up this process's descriptor, and leaves the lock to the parent.
+    void LeaveToParent();
 
 private:
+    const char* mSzPath;
     int mFd = -1;
 };
+
+class RouterLock : public FileLock {
+public:
+    RouterLock() : FileLock(kRouterLock) {}
+};
+
+// Sets one of the two run keys of the system settings. False: it could not be written.
+bool SetRunKey(const char* szKey, const char* szValue);
+
+// One update of a task record: emptied and begun here, published with the object's end on every path.
+class TaskUpdate {
+public:
+    explicit TaskUpdate(NOS::Task& task);
+    ~TaskUpdate();
+    TaskUpdate(const TaskUpdate&) = delete;
+    TaskUpdate& operator=(const TaskUpdate&) = delete;
+
+private:
+    NOS::Task& mTask;
+};
+
+// One text of a record of kTaskOwner's, read anew; empty when there is none.
+std::string TaskText(const char* szId, const char* szName);
 
 // Decimal number of a text as strtol reads it; values outside int are clamped.
 int ToInt(const char* szText);
@@ -88,6 +121,9 @@ bool FillText(char (&szField)[N], const std::string& szText) {
 // szFile and nLine. Both formats take the file and the line.
 ConfList NewSection(const std::string& szName, const char* szNoNode, const char* szNoHash, const char* szFile,
                     int nLine);
+
+// A name beside szPath that nothing has yet: szPath and six more characters.
+std::string UniqueName(const char* szPath);
 
 // Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new
 // one, and the old one is deleted after success and renamed back after failure. True when fnWrite

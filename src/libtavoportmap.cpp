@@ -1,9 +1,11 @@
 // The entry points with C types: support words, the router lock and the busy state, rule arrays, the
-// router description, and saving rules. Relies on the library's own classes and the platform.
-// Promises: arguments are checked before any work, locks are given back on every path.
+// router description, router settings, detection, and saving rules. Relies on the library's own classes
+// and the platform. Promises: arguments are checked before any work, locks are given back on every path.
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 
@@ -16,22 +18,37 @@ namespace {
 constexpr char kFile[] = "src/libtavoportmap.cpp";
 constexpr char kTestScript[] = "testupnp.sh";
 constexpr char kRelayService[] = "tavorelayd";
-constexpr char kUpnpRunKey[] = "runupnpportmapping";
-constexpr char kNatpmpRunKey[] = "runnatpmpportmapping";
-constexpr char kRunKeyFormat[] = "%s=\"%s\"\n";
+constexpr char kRouterConfBak[] = "/etc/portforward/router.conf.bak";
 constexpr int kWaitPolls = 302;
 constexpr unsigned kPollSeconds = 1;
 
 using tavo::lib::AtBorder;
+using tavo::lib::FillText;
+using tavo::lib::kNatpmpRunKey;
 using tavo::lib::kProgressMarker;
+using tavo::lib::kRouterConf;
 using tavo::lib::kRouterLock;
+using tavo::lib::kUpnpRunKey;
 using tavo::lib::LogError;
 using tavo::lib::RouterLock;
+using tavo::lib::SetRunKey;
 
 // The descriptor of the lock that a caller holds across several calls; one per process.
 int gFdRouterLock = -1;
 
 constexpr const char* kSupportWords[] = {"no", "yes", "unknown"};
+
+// The lock of an entry point that was asked to take it; pErr may be null.
+bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
+    if (lock.Get()) {
+        return true;
+    }
+    LogError("%s:%d PortForward conflict = %s", kFile, __LINE__, kRouterLock);
+    if (pErr != nullptr) {
+        *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
+    }
+    return false;
+}
 
 }  // namespace
 
@@ -145,11 +162,7 @@ int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool
         *pErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
     }
     RouterLock lock;
-    if (blLock && !lock.Get()) {
-        LogError("%s:%d PortForward conflict = %s", kFile, __LINE__, kRouterLock);
-        if (pErr != nullptr) {
-            *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
-        }
+    if (blLock && !GetRouterLock(lock, pErr)) {
         return -1;
     }
     struct stat status = {};
@@ -266,15 +279,513 @@ int TLibGetRouterDesc(const char* szGwRouterIP, __tag_TAVO_ROUTER_DESC* routerDe
             return -1;
         }
         RouterLock lock;
-        if (blLock && !lock.Get()) {
-            LogError("%s:%d PortForward conflict = %s", kFile, __LINE__, kRouterLock);
-            if (pErr != nullptr) {
-                *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
-            }
+        if (blLock && !GetRouterLock(lock, pErr)) {
             return -1;
         }
         return FillRouterDesc(szGwRouterIP, *routerDesc);
     });
+}
+
+// ---- router settings ---------------------------------------------------------------------------------------
+
+namespace {
+
+using RouterConf = __tag_TAVO_ROUTER_CONF;
+using ErrorReason = __tag_TAVO_LIBTAVOPORTMAP_ERR;
+
+// UPnP or NAT-PMP drives this router; any other one is driven by its model's script.
+bool IsDaemonRouter(const RouterConf& conf) {
+    return std::strcmp(conf.szSupportUpnp, "yes") == 0 || std::strcmp(conf.szSupportNatpmp, "yes") == 0;
+}
+
+bool IsGatewayArgument(const char* szGwRouterIP, const RouterConf* pConf) {
+    if (pConf == nullptr) {
+        LogError("%s:%d routerConf is NULL", kFile, __LINE__);
+        return false;
+    }
+    if (szGwRouterIP == nullptr) {
+        LogError("%s:%d szGwRouterIP is NULL", kFile, __LINE__);
+        return false;
+    }
+    if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
+        LogError("%s:%d szGwRouterIP=%s is not IP format", kFile, __LINE__, szGwRouterIP);
+        return false;
+    }
+    return true;
+}
+
+bool FillIdentity(RouterConfReader& reader, RouterConf& conf) {
+    using Getter = int (RouterConfReader::*)(std::string&);
+    const struct {
+        Getter fnGet;
+        char (*pSzField)[TAVO_TEXT_SIZE];
+        const char* szNotRead;
+        const char* szNotCopied;
+    } rgFields[] = {
+        {&RouterConfReader::GetBrand, &conf.szBrand, "%s:%d get brand failed", "%s:%d snprintf brand failed"},
+        {&RouterConfReader::GetModel, &conf.szModel, "%s:%d get model failed", "%s:%d snprintf model failed"},
+        {&RouterConfReader::GetVersion, &conf.szVersion, "%s:%d get version failed", "%s:%d snprintf version failed"},
+        {&RouterConfReader::GetSupportUpnp, &conf.szSupportUpnp, "%s:%d get support upnp failed",
+         "%s:%d snprintf szSupportUpnp failed"},
+        {&RouterConfReader::GetSupportNatpmp, &conf.szSupportNatpmp, "%s:%d get support natpmp failed",
+         "%s:%d snprintf szSupportNatpmp failed"},
+    };
+    for (const auto& field : rgFields) {
+        std::string szText;
+        if ((reader.*field.fnGet)(szText) == 0) {
+            LogError(field.szNotRead, kFile, __LINE__);
+            return false;
+        }
+        if (!FillText(*field.pSzField, szText)) {
+            LogError(field.szNotCopied, kFile, __LINE__);
+            return false;
+        }
+    }
+    return true;
+}
+
+// What a manual router needs beyond its identity; what is not stored is left out.
+bool FillAccount(RouterConfReader& reader, RouterConf& conf) {
+    using Getter = int (RouterConfReader::*)(std::string&);
+    const struct {
+        Getter fnGet;
+        char (*pSzField)[TAVO_TEXT_SIZE];
+        const char* szNotCopied;
+    } rgFields[] = {
+        {&RouterConfReader::GetConnType, &conf.szConnType, "%s:%d snprintf szConnType failed"},
+        {&RouterConfReader::GetConnPort, &conf.szConnPort, "%s:%d snprintf szConnPort failed"},
+        {&RouterConfReader::GetUser, &conf.szUser, "%s:%d snprintf szUser failed"},
+        {&RouterConfReader::GetPass, &conf.szPass, "%s:%d snprintf szPass failed"},
+    };
+    for (const auto& field : rgFields) {
+        std::string szText;
+        if ((reader.*field.fnGet)(szText) != 0 && !FillText(*field.pSzField, szText)) {
+            LogError(field.szNotCopied, kFile, __LINE__);
+            return false;
+        }
+    }
+    return true;
+}
+
+bool FillMaxRule(RouterConf& conf) {
+    int nMaxRule = 0;
+    if (!RouterUpnpDB(conf.szBrand, conf.szModel, conf.szVersion).GetMaxRule(nMaxRule)) {
+        LogError("%s:%d get max rule fail", kFile, __LINE__);
+        return false;
+    }
+    if (std::snprintf(conf.szMaxRule, sizeof(conf.szMaxRule), "%d", nMaxRule) < 0) {
+        LogError("%s:%d snprintf szMaxRule failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+constexpr int kNothingStored = 1;
+
+int FillRouterConf(const char* szGwRouterIP, RouterConf& conf) {
+    if (TLIBCFileExist(kRouterConf) != 1) {
+        LogError("%s:%d file=%s not exists", kFile, __LINE__, kRouterConf);
+        return kNothingStored;
+    }
+    RouterConfReader reader{std::string(szGwRouterIP)};
+    bool blExist = false;
+    if (reader.IsSectionExist(blExist) == 0) {
+        LogError("%s:%d file=%s has wrong format, try to unlink it", kFile, __LINE__, kRouterConf);
+        unlink(kRouterConf);
+        return kNothingStored;
+    }
+    if (!blExist) {
+        return kNothingStored;
+    }
+    if (!FillIdentity(reader, conf)) {
+        return -1;
+    }
+    return (IsDaemonRouter(conf) ? FillMaxRule(conf) : FillAccount(reader, conf)) ? 0 : -1;
+}
+
+// Storing goes through three outcomes: done, refused before anything was touched, or to be undone.
+enum class Stored { kDone, kRefused, kUndo };
+
+bool SetIdentity(RouterConfWriter& writer, const RouterConf& conf) {
+    if (conf.szSupportUpnp[0] == '\0') {
+        LogError("%s:%d support_upnp shall not be empty", kFile, __LINE__);
+        return false;
+    }
+    if (conf.szSupportNatpmp[0] == '\0') {
+        LogError("%s:%d support_natpmp shall not be empty", kFile, __LINE__);
+        return false;
+    }
+    if (writer.SetBrandModelVersion(conf.szBrand, conf.szModel, conf.szVersion) == 0) {
+        LogError("%s:%d save config failed", kFile, __LINE__);
+        return false;
+    }
+    if (writer.SetSupportUpnp(conf.szSupportUpnp) == 0) {
+        LogError("%s:%d save support upnp failed", kFile, __LINE__);
+        return false;
+    }
+    if (writer.SetSupportNatpmp(conf.szSupportNatpmp) == 0) {
+        LogError("%s:%d save support natpmp failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+bool SetAccount(RouterConfWriter& writer, const RouterConf& conf) {
+    const bool blAccount = conf.szUser[0] != '\0';
+    if (writer.SetUserPass(blAccount ? conf.szUser : "", blAccount ? conf.szPass : "") == 0) {
+        LogError("%s:%d save user/pass failed", kFile, __LINE__);
+        return false;
+    }
+    if (conf.szConnType[0] == '\0') {
+        LogError("%s:%d conntype shall not be empty", kFile, __LINE__);
+        return false;
+    }
+    if (conf.szConnPort[0] == '\0') {
+        LogError("%s:%d connport shall not be empty", kFile, __LINE__);
+        return false;
+    }
+    if (writer.SetConnType(conf.szConnType) == 0 || writer.SetConnPort(conf.szConnPort) == 0) {
+        LogError("%s:%d save config failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+bool RenameOrLog(const char* szFrom, const char* szTo, int nLine) {
+    if (rename(szFrom, szTo) == 0) {
+        return true;
+    }
+    LogError("%s:%d can not save backup file of '%s'", kFile, nLine, kRouterConfBak);
+    return false;
+}
+
+Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const RouterConf& conf, ErrorReason* pErr) {
+    RouterDB db(szGwRouterIP);
+    if (!SetAccount(writer, conf)) {
+        return Stored::kRefused;
+    }
+    if (TLIBCFileExist(kRouterConf) == 1 && !RenameOrLog(kRouterConf, kRouterConfBak, __LINE__)) {
+        return Stored::kRefused;
+    }
+    if (writer.Sync() == 0) {
+        LogError("%s:%d sync config failed", kFile, __LINE__);
+        return Stored::kUndo;
+    }
+    int nDescribed = 0;
+    if (!db.GetSyntaxVersion(nDescribed)) {
+        LogError("%s:%d can not get router syntax version", kFile, __LINE__);
+        return Stored::kUndo;
+    }
+    if (IGetCurrSyntaxVersion() < nDescribed) {
+        if (pErr != nullptr) {
+            *pErr = TAVO_LIBTAVOPORTMAP_ERR_SYNTAX_VERSION;
+        }
+        LogError("%s:%d syntax version and routerdb version is mis-mtached", kFile, __LINE__);
+        return Stored::kUndo;
+    }
+    return Stored::kDone;
+}
+
+Stored StoreDaemonRouter(RouterConfWriter& writer) {
+    if (writer.Sync() == 0) {
+        LogError("%s:%d sync config failed", kFile, __LINE__);
+        return Stored::kUndo;
+    }
+    return Stored::kDone;
+}
+
+int FinishStoring(Stored enStored) {
+    switch (enStored) {
+        case Stored::kDone:
+            if (TLIBCFileExist(kRouterConfBak) == 1) {
+                unlink(kRouterConfBak);
+            }
+            return 0;
+        case Stored::kUndo:
+            unlink(kRouterConf);
+            if (TLIBCFileExist(kRouterConfBak) == 1) {
+                RenameOrLog(kRouterConfBak, kRouterConf, __LINE__);
+            }
+            return -1;
+        case Stored::kRefused:
+            break;
+    }
+    return -1;
+}
+
+}  // namespace
+
+int TLibGetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr,
+                      bool blLock) {
+    return AtBorder(-1, [&] {
+        if (pErr != nullptr) {
+            *pErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
+        }
+        RouterLock lock;
+        if (!IsGatewayArgument(szGwRouterIP, routerConf) || (blLock && !GetRouterLock(lock, pErr))) {
+            return -1;
+        }
+        return FillRouterConf(szGwRouterIP, *routerConf);
+    });
+}
+
+int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr,
+                      bool blLock) {
+    return AtBorder(-1, [&] {
+        RouterConfWriter writer(false);  // the other gateways' sections go
+        if (pErr != nullptr) {
+            *pErr = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
+        }
+        RouterLock lock;
+        if (!IsGatewayArgument(szGwRouterIP, routerConf) || (blLock && !GetRouterLock(lock, pErr)) ||
+            !SetIdentity(writer, *routerConf)) {
+            return -1;
+        }
+        return FinishStoring(IsDaemonRouter(*routerConf) ? StoreDaemonRouter(writer)
+                                                         : StoreManual(writer, szGwRouterIP, *routerConf, pErr));
+    });
+}
+
+// ---- detection ---------------------------------------------------------------------------------------------
+
+namespace {
+
+using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
+using DetectCallback = void (*)(const DetectResult*, void*);
+
+constexpr int kHopsLookedAt = 3;
+constexpr int kLevelBehindOneRouter = 1;
+constexpr int kLevelUnknown = -1;
+
+enum EnvFlag : int { kEnvGateway = 1, kEnvLevelUnknown = 2, kEnvManyTranslations = 4 };
+
+int SupportOf(const std::string& szVerdict) {
+    if (szVerdict == "yes") {
+        return TAVO_ROUTER_SUPPORT_YES;
+    }
+    return szVerdict == "no" ? TAVO_ROUTER_SUPPORT_NO : TAVO_ROUTER_SUPPORT_UNKNOWN;
+}
+
+// One detection, from the first check to the record. Each step answers whether to go on.
+class Detection {
+public:
+    Detection(DetectResult& result, DetectCallback pfnCallback, void* pArg)
+        : mResult(result), mPfnCallback(pfnCallback), mPArg(pArg) {}
+
+    bool Run(bool blLock, RouterLock& lock);
+
+private:
+    void Progress(int nPercent);
+    bool CheckInterface();
+    void CheckGateway();
+    bool CheckWan();
+    void CheckPublicLevel();
+    bool CheckNames();
+    bool RunDetectors(RouterLock& lock);
+
+    DetectResult& mResult;
+    DetectCallback mPfnCallback;
+    void* mPArg;
+};
+
+void Detection::Progress(int nPercent) {
+    mResult.nProgress = nPercent;
+    if (mPfnCallback != nullptr) {
+        mPfnCallback(&mResult, mPArg);
+    }
+}
+
+bool Detection::CheckInterface() {
+    Progress(20);
+    char szInterface[TAVO_TEXT_SIZE] = {};
+    if (checkGwIfEnable(szInterface, sizeof(szInterface)) != 0) {
+        LogError("%s:%d Network interface is not enabled", kFile, __LINE__);
+        return false;
+    }
+    FillText(mResult.szInterface, szInterface);
+    return true;
+}
+
+void Detection::CheckGateway() {
+    Progress(30);
+    char szGateway[TAVO_TEXT_SIZE] = {};
+    if (checkDefaultGatewaySetting(szGateway, sizeof(szGateway)) != 0) {
+        LogError("%s:%d Gateway setting is not correct", kFile, __LINE__);
+        mResult.nEnvFlags |= kEnvGateway;
+    }
+    FillText(mResult.szGateway, szGateway);
+}
+
+bool Detection::CheckWan() {
+    Progress(40);
+    if (checkConnectToWAN() != 0) {
+        LogError("%s:%d Can not connect to WAN", kFile, __LINE__);
+        mResult.errCode = TAVO_LIBTAVOPORTMAP_ERR_NO_WAN;
+        return false;
+    }
+    return true;
+}
+
+void Detection::CheckPublicLevel() {
+    Progress(70);
+    int nLevel = kLevelUnknown;
+    if (getPublicIPLevel(nLevel, kHopsLookedAt) != 0) {
+        LogError("%s:%d Unable to get public ip level", kFile, __LINE__);
+        mResult.nPublicIPLevel = kLevelUnknown;
+        mResult.nEnvFlags |= kEnvLevelUnknown;
+        return;
+    }
+    mResult.nPublicIPLevel = nLevel;
+    if (nLevel > kLevelBehindOneRouter) {
+        LogError("%s:%d nPublicIPLevel=%d > 1, can not do portforwarding", kFile, __LINE__, nLevel);
+        mResult.nEnvFlags |= kEnvManyTranslations;
+    }
+}
+
+bool Detection::CheckNames() {
+    Progress(50);
+    if (checkDNSSetting() != 0) {
+        LogError("%s:%d DNS setting may be not correct", kFile, __LINE__);
+        mResult.errCode = TAVO_LIBTAVOPORTMAP_ERR_DNS;
+        return false;
+    }
+    return true;
+}
+
+// The wait for NAT-PMP announcements and the search for UPnP go on at the same time, in two processes.
+bool Detection::RunDetectors(RouterLock& lock) {
+    const pid_t pid = TLIBCProcFork();
+    if (pid < 0) {
+        LogError("%s:%d upnp fork error, errno=%s", kFile, __LINE__, std::strerror(errno));
+        return false;
+    }
+    if (pid == 0) {
+        std::string szGatewayIP;
+        if (GetGatewayIP(szGatewayIP) != 0) {
+            NatpmpDetector().Start(szGatewayIP.c_str());
+            _exit(0);
+        }
+        LogError("%s:%d GetGatewayIP() failed", kFile, __LINE__);
+        lock.LeaveToParent();  // unlocking would take it from the parent too
+        return false;
+    }
+    UpnpDetector().Start();
+    while (waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
+    }
+    return true;
+}
+
+bool Detection::Run(bool blLock, RouterLock& lock) {
+    Progress(10);
+    if (blLock && !lock.Get()) {
+        LogError("%s:%d PortForward conflict = %s", kFile, __LINE__, kRouterLock);
+        mResult.errCode = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
+        return false;
+    }
+    if (CleanDetectManualCache() == 0) {
+        LogError("%s:%d Clean cached file failed", kFile, __LINE__);
+        return false;
+    }
+    if (!CheckInterface()) {
+        return false;
+    }
+    CheckGateway();
+    if (!CheckWan()) {
+        return false;
+    }
+    CheckPublicLevel();
+    if (!CheckNames()) {
+        return false;
+    }
+    Progress(80);
+    LogError("%s:%d All network env checks are pass", kFile, __LINE__);
+    int nVersion = 0;
+    if (!RouterUpnpDB::Update(nVersion)) {
+        LogError("%s:%d upgrade db fail", kFile, __LINE__);
+    }
+    if (!RunDetectors(lock)) {
+        return false;
+    }
+    if (DETECT_INFO::fillRouterDetectResult(&mResult) < 0) {
+        LogError("%s:%d fillRouterDetectResult failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+// Who the router is, in the words of the protocol that could tell.
+void FillModel(DetectResult& result, UpnpDetector& upnp, NatpmpDetector& natpmp) {
+    if (upnp.IsAbleToGetBrandModelVersion()) {
+        FillText(result.szBrand, upnp.GetBrand());
+        FillText(result.szModel, upnp.GetModel());
+        FillText(result.szVersion, upnp.GetVersion());
+    } else if (result.enSupportNatpmp == TAVO_ROUTER_SUPPORT_YES) {
+        FillText(result.szUserSettingName, natpmp.GetUserSettingName());
+        FillText(result.szBrand, natpmp.GetBrand());
+        FillText(result.szModel, natpmp.GetModel());
+        FillText(result.szVersion, natpmp.GetVersion());
+    }
+}
+
+}  // namespace
+
+int DETECT_INFO::fillRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult) {
+    return AtBorder(-1, [&] {
+        if (detectResult == nullptr) {
+            LogError("%s:%d detectResult is NULL", kFile, __LINE__);
+            return -1;
+        }
+        NatpmpDetector natpmp;
+        detectResult->enSupportNatpmp = SupportOf(natpmp.GetSupportNatpmp());
+        UpnpDetector upnp;
+        detectResult->enSupportUpnp = SupportOf(upnp.GetSupportUpnp());
+        if (detectResult->enSupportUpnp == TAVO_ROUTER_SUPPORT_YES) {
+            FillText(detectResult->szUpnpPfPath, upnp.GetPfPath());
+        }
+        FillModel(*detectResult, upnp, natpmp);
+        int nMaxRule = -1;
+        const bool blSupported = detectResult->enSupportUpnp == TAVO_ROUTER_SUPPORT_YES ||
+                                 detectResult->enSupportNatpmp == TAVO_ROUTER_SUPPORT_YES;
+        if (blSupported &&
+            !RouterUpnpDB(detectResult->szBrand, detectResult->szModel, detectResult->szVersion).GetMaxRule(nMaxRule)) {
+            LogError("%s:%d can not get max rule, this router may not in routerdb", kFile, __LINE__);
+            return -1;
+        }
+        detectResult->nMaxRule = nMaxRule;
+        return 0;
+    });
+}
+
+int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult,
+                     void (*pfnCallback)(const __tag_TAVO_ROUTER_DETECT_RESULT*, void*), void* arg, bool blLock) {
+    bool blDetected = false;
+    if (detectResult == nullptr) {
+        LogError("%s:%d detectResult is NULL", kFile, __LINE__);
+    } else {
+        blDetected = AtBorder(false, [&] {
+            RouterLock lock;
+            return Detection(*detectResult, pfnCallback, arg).Run(blLock, lock);
+        });
+    }
+    if (pfnCallback != nullptr) {
+        pfnCallback(detectResult, arg);
+    }
+    if (blDetected) {
+        detectResult->nProgress = 100;
+    }
+    return blDetected ? 0 : -1;
+}
+
+int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult) {
+    if (detectResult == nullptr) {
+        LogError("%s:%d Bad parameter, detectResult is NULL", kFile, __LINE__);
+        return -1;
+    }
+    if (DETECT_INFO::fillRouterDetectResult(detectResult) < 0) {
+        LogError("%s:%d fillRouterDetectResult() failed", kFile, __LINE__);
+        return -1;
+    }
+    return 0;
 }
 
 // ---- saving rules ----------------------------------------------------------------------------------------
@@ -389,8 +900,17 @@ void RuleSave::Limits(int nStatus, int nLimit) {
 void RuleSave::Ports(int nStatus, const std::string& szPorts) {
     Status(nStatus);
     if (mPResult != nullptr) {
-        tavo::lib::FillText(mPResult->szPortList, szPorts);
+        FillText(mPResult->szPortList, szPorts);
     }
+}
+
+bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule) {
+    if (rules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
+                      rule.szServiceID, rule.szServiceName) == 0) {
+        LogError("%s:%d add rule failed", kFile, __LINE__);
+        return false;
+    }
+    return true;
 }
 
 bool RuleSave::CollectRules() {
@@ -400,17 +920,11 @@ bool RuleSave::CollectRules() {
             LogError("%s:%d protocol, and port should not be empty", kFile, __LINE__);
             return false;
         }
-        if (mRules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort,
-                           rule.szProtocol, rule.szServiceID, rule.szServiceName) == 0) {
-            LogError("%s:%d add rule failed", kFile, __LINE__);
+        if (!AddRule(mRules, rule)) {
             return false;
         }
     }
     return true;
-}
-
-bool SetRunKey(const char* szKey, const char* szValue) {
-    return TLIBCFileSetKeyValue(tavo::lib::kSystemConf, szKey, szValue, kRunKeyFormat) >= 0;
 }
 
 bool RuleSave::SwitchDaemonsOff() const {

@@ -219,14 +219,14 @@ class Lab:
         for chain in ("miniupnpd", "prerouting_miniupnpd", "postrouting_miniupnpd"):
             self.run("router", f"nft flush chain inet home {chain}")
 
-    def start_scripted(self, fault, port=5000):
-        self.router = self.start("router", "/usr/bin/python3", f"{HERE}/scripted_router.py", fault, str(port),
+    def start_scripted(self, fault, port=5000, host="router", address=GATEWAY):
+        self.router = self.start(host, "/usr/bin/python3", f"{HERE}/scripted_router.py", fault, str(port), address,
                                  stderr=subprocess.DEVNULL)
-        wait_for(lambda: self.scripted(port), 10, "the scripted router is up")
+        wait_for(lambda: self.scripted(port, address), 10, "the scripted router is up")
 
-    def scripted(self, port=5000):
+    def scripted(self, port=5000, address=GATEWAY):
         """Its table and its counters."""
-        out = self.run("box", f"curl -s -m 5 http://{GATEWAY}:{port}/table", check=False).stdout
+        out = self.run("box", f"curl -s -m 5 http://{address}:{port}/table", check=False).stdout
         return json.loads(out) if out else None
 
     def reboot_router(self, **kwargs):

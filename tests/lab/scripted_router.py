@@ -1,6 +1,6 @@
 """A router with faults: SSDP and SOAP on the LAN address, behaving as the named fault says.
 
-Usage: scripted_router.py FAULT [PORT]. GET /table gives its table and its counters as JSON.
+Usage: scripted_router.py FAULT [PORT [ADDRESS]]. GET /table gives its table and its counters as JSON.
 """
 import json
 import re
@@ -11,16 +11,19 @@ import threading
 import time
 from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 
-ADDRESS, FOREIGN = "192.168.77.1", "192.168.77.3"
+FOREIGN = "192.168.77.3"
 FAULT = sys.argv[1]
 PORT = int(sys.argv[2]) if len(sys.argv) > 2 else 5000
+ADDRESS = sys.argv[3] if len(sys.argv) > 3 else "192.168.77.1"
 SERVICE = "urn:schemas-upnp-org:service:WANIPConnection:1"
 TABLE, COUNT, ASKED_402 = {}, {}, set()
 if FAULT == "conflict_foreign":
     TABLE[("TCP", 5001)] = (FOREIGN, 5001, 0, "theirs")
 
+BRAND = {"hostile_brand": "x&quot;; [192.168.1.1]\nuser=&quot;me&quot;&#10;[192.168.77.1]" + "'/../" * 2000}.get(FAULT, "Lab")
 DESCRIPTION = f"""<?xml version="1.0"?><root xmlns="urn:schemas-upnp-org:device-1-0"><device>
-<deviceType>urn:schemas-upnp-org:device:InternetGatewayDevice:1</deviceType><serviceList><service>
+<deviceType>urn:schemas-upnp-org:device:InternetGatewayDevice:1</deviceType><manufacturer>{BRAND}</manufacturer>
+<modelName>Scripted</modelName><modelNumber>7</modelNumber><serviceList><service>
 <serviceType>{SERVICE}</serviceType><controlURL>/ctl</controlURL></service></serviceList></device></root>"""
 LOCATIONS = {"location_other_host": f"http://{FOREIGN}:5000/d.xml", "location_loopback": "http://127.0.0.1:5000/d.xml"}
 

@@ -2,7 +2,6 @@
 import fcntl
 import os
 import signal
-import sys
 import unittest
 
 import homelab
@@ -201,15 +200,11 @@ class FaultyRouter(unittest.TestCase):
                         os.unlink("/var/lib/tavo/upnp_igd.conf")
 
 
-def main(lab):
+def prepare(lab):
     global LAB
     LAB = lab
     lab.serve(5001, 5002, 5003, 5004)
-    result = unittest.main(exit=False, verbosity=2, warnings="ignore").result
-    failed = min(result.testsRun, len(result.failures) + len(result.errors))
-    print(f"{result.testsRun - failed} passed, {failed} failed")
-    return 1 if failed or not result.testsRun else 0
 
 
 if __name__ == "__main__":
-    sys.exit(homelab.in_lab(main))
+    homelab.run_tests(prepare)

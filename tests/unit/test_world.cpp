@@ -7,12 +7,15 @@
 #include <cstdio>
 #include <cstring>
 
+#include "tavo/portforward.h"
 #include "world.h"
 
 std::vector<std::string> gLog;
 std::string gSzFailRename;
 std::string gSzGateway = "192.168.1.1";
 int gNSlept = 0;
+std::function<void()> gFnOnSleep;
+std::function<int()> gFnOnConfSet;
 
 extern "C" {
 
@@ -35,7 +38,18 @@ int rename(const char* szFrom, const char* szTo) {
     return fnReal(szFrom, szTo);
 }
 
+int TAVOGwRouterConfSet(const TAVO_PF_CONF* pHead) {
+    if (gFnOnConfSet) {
+        return gFnOnConfSet();
+    }
+    static const auto fnReal = reinterpret_cast<int (*)(const TAVO_PF_CONF*)>(dlsym(RTLD_NEXT, "TAVOGwRouterConfSet"));
+    return fnReal(pHead);
+}
+
 unsigned sleep(unsigned nSeconds) {
+    if (gFnOnSleep) {
+        gFnOnSleep();
+    }
     gNSlept += static_cast<int>(nSeconds);
     return 0;
 }

@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -15,6 +16,10 @@ extern std::string gSzFailRename;
 extern std::string gSzGateway;
 // Seconds slept; sleep() only counts.
 extern int gNSlept;
+// Called before each sleep is counted.
+extern std::function<void()> gFnOnSleep;
+// Answers in place of the platform's write of router.conf, when set.
+extern std::function<int()> gFnOnConfSet;
 
 inline void Write(const std::string& szPath, const std::string& szText) {
     std::filesystem::create_directories(std::filesystem::path(szPath).parent_path());

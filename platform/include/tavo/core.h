@@ -117,6 +117,9 @@ pid_t TLIBCReadPidFile(const char* szPath);
  * descriptor above standard error), with up to four arguments, ended by the first NULL; returns at
  * once. 0: started; -1: it could not be executed. */
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4);
+/* Forks; the child keeps the caller's descriptors and handlers. The child: 0; the parent: its pid;
+ * negative with errno set: no process could be made. */
+pid_t TLIBCProcFork(void);
 /* Runs a command through /bin/sh with no descriptor above standard error and waits. Its exit status
  * (128 + signal when it was killed); -1: the shell could not be started, or a null command. */
 int TLIBCSystem(const char* szCommand);

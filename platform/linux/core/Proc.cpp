@@ -287,6 +287,10 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
     return 0;
 }
 
+pid_t TLIBCProcFork() {
+    return fork();
+}
+
 int TLIBCSystem(const char* szCommand) {
     if (szCommand == nullptr) {
         return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);

@@ -1,0 +1,149 @@
+// Whether the gateway speaks UPnP, what it is, and whether its model is known to work. Relies on the
+// platform's UPnP client and task records and on the compatibility database. Promises: one detection at a
+// time; a record that was begun is published on every path, and describes the last run only.
+#include "common.h"
+#include "tavo/task.h"
+#include "tavo/upnp.h"
+
+namespace {
+
+constexpr char kFile[] = "src/UpnpDetector.cpp";
+constexpr char kTask[] = ".upnp_detector";
+constexpr char kLock[] = "/tmp/upnp_detector.lock";
+constexpr int kSearchLimitSeconds = 30;
+constexpr int kLocalPort = 55002;
+
+constexpr char kSupport[] = "support_upnp";
+constexpr char kModel[] = "router_model";
+constexpr char kBrand[] = "router_brand";
+constexpr char kVersion[] = "router_version";
+constexpr char kAble[] = "able_get_brand_model_version";
+constexpr char kPfPath[] = "upnp_pfpath";
+
+using tavo::lib::AtBorder;
+using tavo::lib::LogError;
+
+// One step down, and never up or sideways: the name comes from a database, the path must not leave it.
+bool IsPathPart(const std::string& szPart) {
+    return !szPart.empty() && szPart != "." && szPart != ".." && szPart.find('/') == std::string::npos;
+}
+
+bool HasDescription(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
+    if (!IsPathPart(szBrand) || !IsPathPart(szModel) || !IsPathPart(szVersion)) {
+        return false;
+    }
+    const std::string szPath =
+        std::string(tavo::lib::kRouterDbDir) + "/" + szBrand + "/" + szModel + "/" + szVersion + "/router.des";
+    return TLIBCFileExist(szPath.c_str()) == 1;
+}
+
+// Publishes the name of the model's description, when that description is here or can be fetched.
+void NotePfPath(NOS::Task& task, std::string szPfPath) {
+    std::string szBrand;
+    std::string szModel;
+    std::string szVersion;
+    if (!SplitRouterName(szPfPath.data(), szBrand, szModel, szVersion)) {
+        LogError("%s:%d split router name failed", kFile, __LINE__);
+    }
+    if (!HasDescription(szBrand, szModel, szVersion)) {
+        int nVersion = 0;
+        if (!RouterDB::Update(nVersion)) {
+            LogError("%s:%d update router db failed", kFile, __LINE__);
+        }
+        if (!HasDescription(szBrand, szModel, szVersion)) {
+            LogError("%s:%d pfPath does not exist", kFile, __LINE__);
+            return;
+        }
+    }
+    task.setProperty(kPfPath, szPfPath.c_str());
+}
+
+// Everything between the beginning and the end of the record's update.
+bool Detect(NOS::Task& task) {
+    TAVOUpnpCleanup();
+    if (TAVOUpnpInit(kSearchLimitSeconds, kLocalPort) == 1) {
+        tavo::lib::SetRunKey(tavo::lib::kUpnpRunKey, "no");
+        LogError("%s:%d init UPnP faild", kFile, __LINE__);
+        task.setProperty(kSupport, "no");
+        return true;
+    }
+    TAVO_UPNP_GATEWAY_MODEL model = {};
+    if (TAVOUpnpGatewayModelGet(&model) != 0) {
+        task.setProperty(kSupport, "no");
+        return true;
+    }
+    task.setProperty(kModel, model.szModel);
+    task.setProperty(kBrand, model.szBrand);
+    task.setProperty(kVersion, model.szVersion);
+    task.setProperty(kAble, "yes");
+
+    RouterUpnpDB db(model.szBrand, model.szModel, model.szVersion);
+    std::string szPfPath;
+    if (db.GetPfpath(szPfPath) && !szPfPath.empty()) {
+        NotePfPath(task, szPfPath);
+    }
+    std::string szSupport;
+    if (!db.GetSupport(szSupport)) {
+        LogError("%s:%d query router upnp db failed", kFile, __LINE__);
+        task.setProperty(kSupport, "no");
+        return false;
+    }
+    task.setProperty(kSupport, szSupport.c_str());
+    return true;
+}
+
+}  // namespace
+
+UpnpDetector::UpnpDetector() = default;
+
+UpnpDetector::~UpnpDetector() = default;
+
+bool UpnpDetector::Start() {
+    return AtBorder(false, [] {
+        NOS::TaskMgr manager(tavo::lib::kTaskOwner);
+        std::unique_ptr<NOS::Task> pTask(manager.getTask(kTask));
+        tavo::lib::FileLock lock(kLock);
+        if (!lock.Get()) {
+            LogError("%s:%d another upnp detector is running", kFile, __LINE__);
+            return false;
+        }
+        if (!pTask) {
+            pTask.reset(manager.createTask(kTask));
+        }
+        if (!pTask) {
+            return false;
+        }
+        const tavo::lib::TaskUpdate update(*pTask);
+        const bool blDetected = Detect(*pTask);
+        lock.Release();
+        return blDetected;
+    });
+}
+
+std::string UpnpDetector::GetStr(const std::string& key) {
+    return tavo::lib::TaskText(kTask, key.c_str());
+}
+
+std::string UpnpDetector::GetPfPath() {
+    return GetStr(kPfPath);
+}
+
+std::string UpnpDetector::GetVersion() {
+    return GetStr(kVersion);
+}
+
+std::string UpnpDetector::GetBrand() {
+    return GetStr(kBrand);
+}
+
+std::string UpnpDetector::GetModel() {
+    return GetStr(kModel);
+}
+
+std::string UpnpDetector::GetSupportUpnp() {
+    return GetStr(kSupport);
+}
+
+bool UpnpDetector::IsAbleToGetBrandModelVersion() {
+    return GetStr(kAble) == "yes";
+}

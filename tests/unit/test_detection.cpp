@@ -1,0 +1,573 @@
+// Detection, the detection cache and the router's settings, over the real files and task records; the
+// network and the router are stand-ins that each test scripts.
+#include <gtest/gtest.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <functional>
+#include <optional>
+
+#include "libtavoportmap.h"
+#include "network.h"
+#include "tavo/core.h"
+#include "tavo/net.h"
+#include "tavo/portforward.h"
+#include "world.h"
+
+Network* gPNetwork = nullptr;
+
+namespace {
+
+// Called when a detection begins to look for UPnP.
+std::function<void()> gFnOnDetectorInit;
+
+}  // namespace
+
+extern "C" {
+int checkGwIfEnable(char* szInterface, int nSize) {
+    if (gPNetwork == nullptr) {
+        return Real("checkGwIfEnable", &checkGwIfEnable)(szInterface, nSize);
+    }
+    snprintf(szInterface, static_cast<size_t>(nSize), "eth0");
+    return gPNetwork->nInterface;
+}
+int checkDefaultGatewaySetting(char* szGateway, int nSize) {
+    if (gPNetwork == nullptr) {
+        return Real("checkDefaultGatewaySetting", &checkDefaultGatewaySetting)(szGateway, nSize);
+    }
+    snprintf(szGateway, static_cast<size_t>(nSize), "192.168.1.1");
+    return gPNetwork->nGateway;
+}
+int checkConnectToWAN() {
+    return gPNetwork == nullptr ? Real("checkConnectToWAN", &checkConnectToWAN)() : gPNetwork->nWan;
+}
+int checkDNSSetting() {
+    return gPNetwork == nullptr ? Real("checkDNSSetting", &checkDNSSetting)() : gPNetwork->nDns;
+}
+int TAVOUpnpInit(int nLimit, int nPort) {
+    if (gPNetwork == nullptr) {
+        return Real("TAVOUpnpInit", &TAVOUpnpInit)(nLimit, nPort);
+    }
+    if (gFnOnDetectorInit) {
+        gFnOnDetectorInit();
+    }
+    gPNetwork->nUpnpPort = nPort;
+    return nLimit == 30 ? gPNetwork->nUpnpInit : 1;
+}
+int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL* pModel) {
+    if (gPNetwork == nullptr) {
+        return Real("TAVOUpnpGatewayModelGet", &TAVOUpnpGatewayModelGet)(pModel);
+    }
+    *pModel = gPNetwork->model.value_or(TAVO_UPNP_GATEWAY_MODEL{});
+    return gPNetwork->model ? 0 : -1;
+}
+int TLIBServiceRestart(const char* szName) {
+    if (gPNetwork == nullptr) {
+        return Real("TLIBServiceRestart", &TLIBServiceRestart)(szName);
+    }
+    if (gPNetwork->szAnnounced) {
+        Write("/tmp/airport.tcp.local", *gPNetwork->szAnnounced);
+    }
+    return strcmp(szName, "avahi") == 0 ? gPNetwork->nServiceRestart : -2;
+}
+int TAVOPFRouterDBUpdate() {
+    if (gPNetwork == nullptr) {
+        return Real("TAVOPFRouterDBUpdate", &TAVOPFRouterDBUpdate)();
+    }
+    ++gPNetwork->nRouterDbUpdates;
+    gPNetwork->fnRouterDbUpdate();
+    return 1;
+}
+}
+
+int getPublicIPLevel(int& nLevel, int nHops) {
+    if (gPNetwork == nullptr) {
+        return Real("_Z16getPublicIPLevelRii", &getPublicIPLevel)(nLevel, nHops);
+    }
+    nLevel = gPNetwork->nLevel.value_or(nLevel);
+    return nHops == 3 && gPNetwork->nLevel ? 0 : -1;
+}
+
+namespace {
+
+using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
+using RouterConf = __tag_TAVO_ROUTER_CONF;
+
+constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+constexpr char kRouterConfBak[] = "/etc/portforward/router.conf.bak";
+constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+constexpr char kAnnounced[] = "/tmp/airport.tcp.local";
+
+bool IsLockFree(const char* szPath) {
+    int fd = -1;
+    const bool blFree = lock_file(szPath, fd) == 1;
+    unlock_file(fd);
+    return blFree;
+}
+
+class Detection : public testing::Test {
+protected:
+    void SetUp() override {
+        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/bin"}) {
+            std::filesystem::remove_all(szDir);
+            std::filesystem::create_directories(szDir);
+        }
+        std::filesystem::remove_all("/var/lib/tavo/tasks");
+        for (const char* szFile : {"/etc/tavoinfo.conf", kAnnounced}) {
+            std::filesystem::remove(szFile);
+        }
+        Write("/etc/portforward/router_upnp.db",
+              "[Acme/R1/1.0]\nsupport=yes\nmax=32\npfpath=Acme: R1(1.0)\n[AirPort//]\nsupport=yes\nmax=5\n"
+              "[Bad/R/1]\nsupport=yes\npfpath=../..: etc(x)\n");
+        Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
+        SetTool("syntax version=1");
+        gLog.clear();
+        gSzGateway = "192.168.1.1";
+        gFnOnSleep = nullptr;
+        gPNetwork = &mNetwork;
+    }
+    void TearDown() override {
+        gPNetwork = nullptr;
+        gFnOnSleep = nullptr;
+        gFnOnConfSet = nullptr;
+    }
+    static void SetTool(const std::string& szLine) {
+        Write(kTool, "#!/bin/sh\necho '" + szLine + "'\n");
+        chmod(kTool, 0755);
+    }
+    Network mNetwork;
+};
+
+// ---- the cache -----------------------------------------------------------------------------------------
+
+TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
+    EXPECT_EQ(DetectCache::ToString(static_cast<__TAG_TAVO_ROUTER_INIT_STATE>(4)), "");
+    EXPECT_TRUE(Logged("non supported enState=4"));
+    EXPECT_EQ(CleanDetectManualCache(), 1);
+    ASSERT_EQ(SetDetectManualCache("10.0.0.1", "A", "B", "C"), 1);
+    ASSERT_EQ(SetDetectManualCache("192.168.1.1", "x\"; [10.0.0.1]\n", "R1", "2"), 1);
+    EXPECT_EQ(Read(SZF_DETECT_MANUAL_CACHE).find("\n["), std::string::npos);
+
+    auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
+    std::string szText = "kept";
+    DetectCacheReader reader("192.168.1.1");
+    EXPECT_EQ(reader.GetBrand(szText), 0);
+    EXPECT_TRUE(Logged("can not GetBrand(), mEnReaderState=not initialized"));
+    bool blExisted = false;
+    ASSERT_EQ(reader.IsSectionExisted(blExisted), 1);
+    EXPECT_TRUE(blExisted);
+    EXPECT_EQ(reader.GetType(enState), 1);
+    EXPECT_EQ(enState, TAVO_ROUTER_INIT_STATE_MANUAL);
+    EXPECT_EQ(reader.GetBrand(szText), 1);
+    EXPECT_EQ(szText, "x\"; [10.0.0.1]\n");
+
+    DetectCacheReader other("10.0.0.1");
+    EXPECT_EQ(other.IsSectionExisted(blExisted), 1);
+    EXPECT_FALSE(blExisted);
+    EXPECT_EQ(other.GetType(enState), 0);
+    EXPECT_TRUE(Logged("can not GetVersion(), mEnReaderState=section not existed"));
+    Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=Manual\n");
+    DetectCacheReader odd("192.168.1.1");
+    ASSERT_EQ(odd.Init(), 1);
+    EXPECT_EQ(odd.GetType(enState), 0);
+    EXPECT_TRUE(Logged("invalid szValue=Manual"));
+    EXPECT_EQ(odd.GetModel(szText), 0);
+    EXPECT_TRUE(Logged("TLIBCSzHashGetValue(model) failed"));
+
+    Write(SZF_DETECT_MANUAL_CACHE, "nonsense\n");
+    DetectCacheReader broken("192.168.1.1");
+    EXPECT_EQ(broken.IsSectionExisted(blExisted), 0);
+    EXPECT_TRUE(Logged("Init() failed"));
+    EXPECT_EQ(broken.IsSectionExisted(blExisted), 0);  // loaded once, and for good
+    EXPECT_TRUE(Logged("initialize failed"));
+}
+
+// ---- the detectors ---------------------------------------------------------------------------------------
+
+struct UpnpCase {
+    const char* szWhat;
+    int nInit;
+    std::optional<TAVO_UPNP_GATEWAY_MODEL> model;
+    bool blResult;
+    const char* szSupport;
+    const char* szPfPath;
+    int nUpdates;
+    const char* szLine;
+};
+
+TEST_F(Detection, UpnpVerdicts) {
+    std::filesystem::create_directories("/etc.defaults/portforward/routerdb/x");
+    const UpnpCase rgCases[] = {
+        {"known model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"}, true, "yes", "Acme: R1(1.0)", 0, ""},
+        {"no router", 1, {}, true, "no", "", 0, "init UPnP faild"},
+        {"no model", 0, {}, true, "no", "", 0, ""},
+        {"brand for all models", 0, TAVO_UPNP_GATEWAY_MODEL{"AirPort", "x", "y"}, true, "yes", "", 0, ""},
+        {"unknown model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R2", "1.0"}, true, "unknown", "", 0, ""},
+        {"no name at all", 0, TAVO_UPNP_GATEWAY_MODEL{}, false, "no", "", 0, "query router upnp db failed"},
+        {"path out of the database", 0, TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}, true, "yes", "", 1,
+         "pfPath does not exist"},
+    };
+    Write("/etc.defaults/portforward/etc/x/router.des", "");
+    for (const UpnpCase& upnpCase : rgCases) {
+        SCOPED_TRACE(upnpCase.szWhat);
+        mNetwork = Network();
+        mNetwork.nUpnpInit = upnpCase.nInit;
+        mNetwork.model = upnpCase.model;
+        gLog.clear();
+        UpnpDetector detector;
+        EXPECT_EQ(detector.Start(), upnpCase.blResult);
+        EXPECT_EQ(mNetwork.nUpnpPort, 55002);
+        EXPECT_EQ(detector.GetSupportUpnp(), upnpCase.szSupport);
+        EXPECT_EQ(detector.GetPfPath(), upnpCase.szPfPath);
+        EXPECT_EQ(detector.IsAbleToGetBrandModelVersion(), upnpCase.model.has_value());
+        EXPECT_EQ(detector.GetBrand(), upnpCase.model ? upnpCase.model->szBrand : "");
+        EXPECT_EQ(mNetwork.nRouterDbUpdates, upnpCase.nUpdates);
+        EXPECT_TRUE(*upnpCase.szLine == '\0' || Logged(upnpCase.szLine));
+        EXPECT_TRUE(IsLockFree("/tmp/upnp_detector.lock"));
+        EXPECT_EQ(Read("/etc/tavoinfo.conf") == "runupnpportmapping=\"no\"\n", upnpCase.nInit == 1);
+        std::filesystem::remove("/etc/tavoinfo.conf");
+    }
+}
+
+TEST_F(Detection, MissingDescriptionIsFetchedOnceAndALockedDetectionChangesNothing) {
+    std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme");
+    UpnpDetector detector;
+    EXPECT_TRUE(detector.Start());
+    EXPECT_EQ(detector.GetPfPath(), "");
+    mNetwork.fnRouterDbUpdate = [] { Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", ""); };
+    EXPECT_TRUE(detector.Start());
+    EXPECT_EQ(detector.GetPfPath(), "Acme: R1(1.0)");
+    EXPECT_EQ(mNetwork.nRouterDbUpdates, 2);
+
+    int fd = -1;
+    ASSERT_EQ(lock_file("/tmp/upnp_detector.lock", fd), 1);
+    mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Other", "R2", "2"};
+    EXPECT_FALSE(detector.Start());
+    EXPECT_TRUE(Logged("another upnp detector is running"));
+    EXPECT_EQ(detector.GetBrand(), "Acme");
+    unlock_file(fd);
+}
+
+struct AirPortCase {
+    const char* szWhat;
+    int nCreated;  // poll before which the file appears; 0: never
+    int nGone;     // poll before which it vanishes
+    const char* szText;
+    const char* szSupport;
+    const char* szName;
+    int nSleeps;
+};
+
+TEST_F(Detection, AirPortPolls) {
+    const AirPortCase rgCases[] = {
+        {"seen in poll 3, confirmed in 4", 3, 0, "[192.168.1.1]\nname=Den\n", "yes", "Den", 3},
+        {"first seen in the last poll", 6, 0, "[192.168.1.1]\nname=Den\n", "yes", "Den", 6},
+        {"never there", 0, 0, "", "no", "", 6},
+        {"gone again", 5, 6, "[192.168.1.1]\nname=Den\n", "no", "", 6},
+        {"another base station", 1, 0, "[192.168.1.9]\nname=Den\n", "no", "", 1},
+        {"no name", 1, 0, "[192.168.1.1]\nkind=x\n", "yes", "", 1},
+        {"no list", 1, 0, "garbage\n", "no", "", 1},
+    };
+    for (const AirPortCase& airPort : rgCases) {
+        SCOPED_TRACE(airPort.szWhat);
+        Write(kAnnounced, "[192.168.1.1]\nname=stale\n");
+        std::filesystem::remove("/etc/tavoinfo.conf");
+        gNSlept = 0;
+        const auto fnBefore = [&](int nPoll) {
+            if (nPoll == airPort.nCreated) {
+                Write(kAnnounced, airPort.szText);
+            } else if (nPoll == airPort.nGone) {
+                std::filesystem::remove(kAnnounced);
+            }
+        };
+        gFnOnSleep = [&] { fnBefore(gNSlept + 2); };  // the poll that follows
+        mNetwork.szAnnounced = airPort.nCreated == 1 ? std::optional<std::string>(airPort.szText) : std::nullopt;
+        NatpmpDetector detector;
+        EXPECT_TRUE(detector.Start("192.168.1.1"));
+        EXPECT_EQ(detector.GetSupportNatpmp(), airPort.szSupport);
+        EXPECT_EQ(detector.GetUserSettingName(), airPort.szName);
+        EXPECT_EQ(detector.GetBrand(), std::string(airPort.szSupport) == "yes" ? "AirPort" : "");
+        EXPECT_EQ(gNSlept, airPort.nSleeps);
+        EXPECT_EQ(Read("/etc/tavoinfo.conf"),
+                  std::string(airPort.szSupport) == "no" ? "runnatpmpportmapping=\"no\"\n" : "");
+        EXPECT_TRUE(IsLockFree("/tmp/natpmp_detector.lock"));
+    }
+}
+
+TEST_F(Detection, NatpmpRefusals) {
+    NatpmpDetector detector;
+    EXPECT_FALSE(detector.Start(nullptr));
+    EXPECT_FALSE(detector.Start(""));
+    EXPECT_TRUE(Logged("szGatewayIP is NULL or empty"));
+    mNetwork.szAnnounced = "[192.168.1.1]\nname=Den\n";
+    ASSERT_TRUE(detector.Start("192.168.1.1"));
+    mNetwork.nServiceRestart = -1;
+    EXPECT_FALSE(detector.Start("192.168.1.1"));
+    EXPECT_TRUE(Logged("call TLIBNetService() error"));
+    EXPECT_EQ(detector.GetSupportNatpmp(), "");  // the emptied record was published
+    EXPECT_TRUE(IsLockFree("/tmp/natpmp_detector.lock"));
+}
+
+// ---- the driver ------------------------------------------------------------------------------------------
+
+struct DriverCase {
+    const char* szWhat;
+    std::function<void(Network&)> fnChange;
+    std::vector<int> rgProgress;
+    int nResult;
+    int nErr;
+    int nFlags;
+    int nMaxRule;
+    const char* szLine;
+};
+
+void NoteProgress(const DetectResult* pResult, void* pData) {
+    static_cast<std::vector<int>*>(pData)->push_back(pResult == nullptr ? -1 : pResult->nProgress);
+}
+
+TEST_F(Detection, DriverInEachNetwork) {
+    const std::vector<int> rgWhole = {10, 20, 30, 40, 70, 50, 80, 80};
+    const DriverCase rgCases[] = {
+        {"all is well", [](Network&) {}, rgWhole, 0, 0, 0, 32, "All network env checks are pass"},
+        {"no interface",
+         [](Network& net) { net.nInterface = -1; },
+         {10, 20, 20},
+         -1,
+         0,
+         0,
+         0,
+         "Network interface is not enabled"},
+        {"no WAN", [](Network& net) { net.nWan = -1; }, {10, 20, 30, 40, 40}, -1, 3, 0, 0, "Can not connect to WAN"},
+        {"no DNS",
+         [](Network& net) { net.nDns = -1; },
+         {10, 20, 30, 40, 70, 50, 50},
+         -1,
+         4,
+         0,
+         0,
+         "DNS setting may be not correct"},
+        {"odd gateway and two routers",
+         [](Network& net) {
+             net.nGateway = -1;
+             net.nLevel = 2;
+         },
+         rgWhole, 0, 0, 1 | 4, 32, "nPublicIPLevel=2 > 1, can not do portforwarding"},
+        {"level unknown", [](Network& net) { net.nLevel.reset(); }, rgWhole, 0, 0, 2, 32,
+         "Unable to get public ip level"},
+        {"neither protocol", [](Network& net) { net.nUpnpInit = 1; }, rgWhole, 0, 0, 0, -1, "upgrade db fail"},
+        {"supported, but nobody knows its maximum",
+         [](Network& net) {
+             net.model = TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"};
+         },
+         rgWhole, -1, 0, 0, 0, "fillRouterDetectResult failed"},
+    };
+    for (const DriverCase& driver : rgCases) {
+        SCOPED_TRACE(driver.szWhat);
+        mNetwork = Network();
+        driver.fnChange(mNetwork);
+        gLog.clear();
+        ASSERT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1);
+        DetectResult result = {};
+        std::vector<int> rgProgress;
+        EXPECT_EQ(TLibDetectRouter(&result, &NoteProgress, &rgProgress, true), driver.nResult);
+        EXPECT_EQ(rgProgress, driver.rgProgress);
+        EXPECT_EQ(result.nProgress, driver.nResult == 0 ? 100 : driver.rgProgress.back());
+        EXPECT_EQ(result.errCode, driver.nErr);
+        EXPECT_EQ(result.nEnvFlags, driver.nFlags);
+        EXPECT_EQ(result.nMaxRule, driver.nMaxRule);
+        EXPECT_TRUE(Logged(driver.szLine));
+        EXPECT_FALSE(DetectCache::IsCacheExisted());
+        EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+    }
+}
+
+TEST_F(Detection, DriverFillsTheRecordFromBothDetectors) {
+    DetectResult result = {};
+    ASSERT_EQ(TLibDetectRouter(&result, nullptr, nullptr, false), 0);
+    EXPECT_STREQ(result.szInterface, "eth0");
+    EXPECT_STREQ(result.szGateway, "192.168.1.1");
+    EXPECT_EQ(result.enSupportUpnp, TAVO_ROUTER_SUPPORT_YES);
+    EXPECT_EQ(result.enSupportNatpmp, TAVO_ROUTER_SUPPORT_NO);
+    EXPECT_STREQ(result.szUpnpPfPath, "Acme: R1(1.0)");
+    EXPECT_STREQ(result.szModel, "R1");
+
+    mNetwork.nUpnpInit = 1;
+    mNetwork.szAnnounced = "[192.168.1.1]\nname=\"x\\\"; [192.168.1.1]\"\n";
+    result = {};
+    ASSERT_EQ(TLibDetectRouter(&result, nullptr, nullptr, false), 0);
+    EXPECT_EQ(result.enSupportUpnp, TAVO_ROUTER_SUPPORT_NO);
+    EXPECT_EQ(result.enSupportNatpmp, TAVO_ROUTER_SUPPORT_YES);
+    EXPECT_STREQ(result.szBrand, "AirPort");
+    EXPECT_STREQ(result.szUserSettingName, "x\"; [192.168.1.1]");
+    EXPECT_EQ(result.nMaxRule, 5);
+    DetectResult later = {};
+    EXPECT_EQ(TLibGetRouterDetectResult(&later), 0);
+    EXPECT_STREQ(later.szUserSettingName, result.szUserSettingName);
+    EXPECT_EQ(TLibGetRouterDetectResult(nullptr), -1);
+    EXPECT_TRUE(Logged("Bad parameter, detectResult is NULL"));
+}
+
+TEST_F(Detection, DriverRefusals) {
+    std::vector<int> rgProgress;
+    EXPECT_EQ(TLibDetectRouter(nullptr, &NoteProgress, &rgProgress, true), -1);
+    EXPECT_EQ(rgProgress, std::vector<int>{-1});
+    EXPECT_EQ(gLog, std::vector<std::string>{"detectResult is NULL"});
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    ASSERT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1);
+    DetectResult result = {};
+    rgProgress.clear();
+    EXPECT_EQ(TLibDetectRouter(&result, &NoteProgress, &rgProgress, true), -1);
+    EXPECT_EQ(rgProgress, (std::vector<int>{10, 10}));
+    EXPECT_EQ(result.errCode, 2);
+    EXPECT_TRUE(DetectCache::IsCacheExisted());
+    TLibTavoPortMapUnLock();
+}
+
+TEST_F(Detection, ChildWithoutGatewayReturnsAndLeavesTheLockToItsParent) {
+    gSzGateway.clear();
+    const pid_t pidSelf = getpid();
+    DetectResult result = {};
+    const auto fnNote = [](const DetectResult* pResult, void* pData) {
+        if (getpid() != *static_cast<const pid_t*>(pData)) {
+            Write("/tmp/child_progress", std::to_string(pResult->nProgress));
+        }
+    };
+    std::filesystem::remove("/tmp/child_progress");
+    bool blLockedAfterChild = false;
+    gFnOnDetectorInit = [&] {
+        for (int i = 0; i < 500 && !std::filesystem::exists("/tmp/child_done"); ++i) {
+            usleep(10000);
+        }
+        blLockedAfterChild = !IsLockFree("/tmp/routerconf.lock");
+    };
+    std::filesystem::remove("/tmp/child_done");
+    pid_t pidArgument = pidSelf;
+    const int nResult = TLibDetectRouter(&result, +fnNote, &pidArgument, true);
+    if (getpid() != pidSelf) {
+        Write("/tmp/child_done", std::to_string(nResult));
+        _exit(0);
+    }
+    gFnOnDetectorInit = nullptr;
+    EXPECT_EQ(Read("/tmp/child_done"), "-1");
+    EXPECT_EQ(Read("/tmp/child_progress"), "80");
+    EXPECT_TRUE(blLockedAfterChild);
+    EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+}
+
+// ---- the router's settings -------------------------------------------------------------------------------
+
+RouterConf MakeConf(const char* szUpnp, const char* szNatpmp) {
+    RouterConf conf = {};
+    const auto fnFill = [](char(&szField)[1024], const char* szText) {
+        snprintf(szField, sizeof(szField), "%s", szText);
+    };
+    fnFill(conf.szBrand, "Acme");
+    fnFill(conf.szModel, "R1");
+    fnFill(conf.szVersion, "1.0");
+    fnFill(conf.szSupportUpnp, szUpnp);
+    fnFill(conf.szSupportNatpmp, szNatpmp);
+    fnFill(conf.szUser, "admin");
+    fnFill(conf.szPass, "p\"w");
+    fnFill(conf.szConnType, "http");
+    fnFill(conf.szConnPort, "80");
+    return conf;
+}
+
+TEST_F(Detection, SettingsRoundTrip) {
+    RouterConf conf = MakeConf("no", "no");
+    auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
+    EXPECT_EQ(TLibGetRouterConf("192.168.1.1", &conf, &enErr, true), 1);
+    EXPECT_TRUE(Logged(std::string("file=") + kRouterConf + " not exists"));
+    Write(kRouterConf, "[10.0.0.1]\nbrand=old\n");
+    EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, &enErr, true), 0);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);  // stays so after success
+    EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
+    EXPECT_EQ(Read(kRouterConf).rfind('['), 0U);  // one section, named by the current gateway
+    RouterConf read = {};
+    EXPECT_EQ(TLibGetRouterConf("10.9.9.9", &read, &enErr, true), 1);
+    snprintf(read.szMaxRule, sizeof(read.szMaxRule), "kept");
+    ASSERT_EQ(TLibGetRouterConf("192.168.1.1", &read, &enErr, true), 0);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_NONE);
+    EXPECT_STREQ(read.szPass, "p\"w");
+    EXPECT_STREQ(read.szConnPort, "80");
+    EXPECT_STREQ(read.szMaxRule, "kept");
+
+    conf = MakeConf("yes", "no");
+    ASSERT_EQ(TLibSetRouterConf("10.9.9.9", &conf, nullptr, true), 0);  // the gateway names the section
+    read = {};
+    snprintf(read.szUser, sizeof(read.szUser), "kept");
+    ASSERT_EQ(TLibGetRouterConf("192.168.1.1", &read, nullptr, true), 0);
+    EXPECT_STREQ(read.szMaxRule, "32");
+    EXPECT_STREQ(read.szUser, "kept");
+    EXPECT_EQ(Read(kRouterConf).find("admin"), std::string::npos);
+
+    Write(kRouterConf, "this is no router file\n");
+    EXPECT_EQ(TLibGetRouterConf("192.168.1.1", &read, nullptr, true), 1);
+    EXPECT_FALSE(std::filesystem::exists(kRouterConf));
+}
+
+struct StoreFault {
+    const char* szWhat;
+    std::function<void(RouterConf&)> fnBreak;
+    const char* szLine;
+    bool blKept;  // the old file is there afterwards
+    int nErr;
+};
+
+TEST_F(Detection, SettingsAfterEachFault) {
+    const std::string szOld = "[192.168.1.1]\nbrand=old\n";
+    const auto fnUpnp = [](RouterConf& conf) { snprintf(conf.szSupportUpnp, 1024, "yes"); };
+    const StoreFault rgFaults[] = {
+        {"no support word", [](RouterConf& conf) { conf.szSupportNatpmp[0] = '\0'; },
+         "support_natpmp shall not be empty", true, 1},
+        {"no connection type", [](RouterConf& conf) { conf.szConnType[0] = '\0'; }, "conntype shall not be empty", true,
+         1},
+        {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty", true, 1},
+        {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed", true, 1},
+        {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
+         "can not save backup file of '/etc/portforward/router.conf.bak'", true, 1},
+        {"failed write", [](RouterConf&) { gFnOnConfSet = [] { return -1; }; }, "sync config failed", true, 1},
+        {"no description", [](RouterConf&) { std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme"); },
+         "can not get router syntax version", true, 1},
+        {"old tool", [](RouterConf&) { SetTool("syntax version=0"); },
+         "syntax version and routerdb version is mis-mtached", true, 6},
+        {"UPnP router, failed write",
+         [&](RouterConf& conf) {
+             fnUpnp(conf);
+             gFnOnConfSet = [] { return -1; };
+         },
+         "sync config failed", false, 1},
+        {"lock held", [](RouterConf&) { TLibTavoPortMapLock(); }, "PortForward conflict = /tmp/routerconf.lock", true,
+         2},
+    };
+    for (const StoreFault& fault : rgFaults) {
+        SCOPED_TRACE(fault.szWhat);
+        SetUp();
+        Write(kRouterConf, szOld);
+        RouterConf conf = MakeConf("no", "no");
+        fault.fnBreak(conf);
+        auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
+        EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, &enErr, true), -1);
+        EXPECT_TRUE(Logged(fault.szLine));
+        EXPECT_EQ(Read(kRouterConf), fault.blKept ? szOld : "");
+        EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
+        EXPECT_EQ(enErr, fault.nErr);
+        EXPECT_TRUE(gSzFailRename.empty());
+        if (fault.nErr == 2) {
+            TLibTavoPortMapUnLock();
+        }
+        EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+        TearDown();
+    }
+    // What an earlier failed restore left comes back after a failed write of a UPnP router.
+    SetUp();
+    Write(kRouterConf, szOld);
+    Write(kRouterConfBak, "[192.168.1.1]\nbrand=older\n");
+    RouterConf conf = MakeConf("yes", "no");
+    gFnOnConfSet = [] { return -1; };
+    EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, nullptr, true), -1);
+    EXPECT_EQ(Read(kRouterConf), "[192.168.1.1]\nbrand=older\n");
+}
+
+}  // namespace
