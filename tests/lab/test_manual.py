@@ -101,21 +101,6 @@ class Manual(unittest.TestCase):
                 self.assertEqual(self.forwards(), FOREIGN)
                 LAB.stop_router()
 
-    def test_operations_that_cannot_be_performed(self):
-        good = "[PF add port]\npath=/a\n[PF delete port]\npath=/d\n"
-        table = (("[login]\nform=x\n" + good, "[login] has no path"), (good + "sleep=1\n", '"sleep" of [PF delete port]'),
-                 ("[global]\nsyntax version=2\n" + good, '"syntax version" of [global]'),
-                 ("[PF add port]\npath=/a\n", "[PF delete port] is missing"), (good + "[PF lst]\npath=/l\n", "[PF lst]"),
-                 (good + "path=http://192.168.77.3/\n", '"path" of'), (good + "take x=([0-9\n", '"take x" of'),
-                 (good + "header X: y=z\n", '"header X: y" of'), ("no sections\n", "no sectioned file"))
-        for text, why in table:
-            with self.subTest(text=text):
-                LAB.write("/tmp/router.ops", text)
-                out = LAB.run("box", f"{TOOL} --check /tmp/router.ops", check=False)
-                self.assertEqual((out.returncode, why in out.stdout), (1, True), out.stdout)
-        samples = f"find {HERE}/../../packaging/routerdb -name router.ops -exec {TOOL} --check {{}} +"
-        self.assertEqual(LAB.run("box", samples).stdout, "")
-
     def test_an_expression_that_would_never_end(self):
         LAB.start_web("form")
         path = "/etc.defaults/portforward/routerdb/Alderman/Homestead 2/1.0/router.ops"
@@ -156,6 +141,23 @@ class Manual(unittest.TestCase):
         tool.send_signal(signal.SIGKILL)
         tool.wait()
         self.saved({})
+
+
+class Database(unittest.TestCase):
+    def test_operations_that_cannot_be_performed(self):
+        good = "[PF add port]\npath=/a\n[PF delete port]\npath=/d\n"
+        table = (("[login]\nform=x\n" + good, "[login] has no path"), (good + "sleep=1\n", '"sleep" of [PF delete port]'),
+                 ("[global]\nsyntax version=2\n" + good, '"syntax version" of [global]'),
+                 ("[PF add port]\npath=/a\n", "[PF delete port] is missing"), (good + "[PF lst]\npath=/l\n", "[PF lst]"),
+                 (good + "path=http://192.168.77.3/\n", '"path" of'), (good + "take x=([0-9\n", '"take x" of'),
+                 (good + "header X: y=z\n", '"header X: y" of'), ("no sections\n", "no sectioned file"))
+        for text, why in table:
+            with self.subTest(text=text):
+                LAB.write("/tmp/router.ops", text)
+                out = LAB.run("box", f"{TOOL} --check /tmp/router.ops", check=False)
+                self.assertEqual((out.returncode, why in out.stdout), (1, True), out.stdout)
+        samples = f"find {HERE}/../../packaging/routerdb -name router.ops -exec {TOOL} --check {{}} +"
+        self.assertEqual(LAB.run("box", samples).stdout, "")
 
 
 def prepare(lab):

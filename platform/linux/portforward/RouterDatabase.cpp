@@ -121,12 +121,16 @@ std::string Quoted(const std::string& szText) {
 
 bool FetchAndUnpack(const fs::path& scratch) {
     const std::string szArchive = Quoted(scratch / kArchive);
+    const std::string szTar = Quoted(scratch / "tar");
     const std::string szNew = Quoted(scratch / "new");
-    // tar refuses absolute names and ".." by itself; 64 MiB bound what a server can fill the disk with.
-    const std::string szCommand = "ulimit -f 131072; timeout 300 /usr/tavo/bin/wget " +
-                                  Quoted(std::string(GetRouterDBPath()) + "/" + kArchive) + " -O " + szArchive +
-                                  " >/dev/null 2>&1 && mkdir " + szNew + " && timeout 60 tar -xzf " + szArchive +
-                                  " -C " + szNew + " --no-same-owner >/dev/null 2>&1";
+    // 64 MiB bound what a server can fill the disk with: as it arrives, and in one file as it unpacks. tar
+    // would mend a name that leads outside; who packs such a name means harm, and the whole archive is refused.
+    const std::string szCommand =
+        "ulimit -f 131072; export LC_ALL=C; exec >/dev/null 2>&1; timeout 300 "
+        "/usr/tavo/bin/wget " +
+        Quoted(std::string(GetRouterDBPath()) + "/" + kArchive) + " -O " + szArchive + " && timeout 60 gzip -dc " +
+        szArchive + " >" + szTar + " && ! tar -tf " + szTar + " | grep -qE '^/|(^|/)[.][.](/|$)' && mkdir " + szNew +
+        " && timeout 60 tar -xf " + szTar + " -C " + szNew + " --no-same-owner";
     return TLIBCSystem(szCommand.c_str()) == 0;
 }
 
