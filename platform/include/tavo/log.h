@@ -18,6 +18,10 @@ enum { /* events of TAVOLogSet1 */
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4);
 
+/* Appends one line to the router log, /var/log/router.log: time and text, control characters made
+ * harmless. nKind 1: the router log, the only kind; nLevel: 1 information. 0: written; -1: failed. */
+int TAVOWriteLog(const char* szText, int nKind, int nLevel);
+
 #ifdef __cplusplus
 }
 #endif
