@@ -1,7 +1,9 @@
 // The IGD client against hostile answers, and Reconcile against a router in memory.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <map>
+#include <tuple>
 
 #include "daemons/common/Reconcile.h"
 #include "upnp/Igd.h"
@@ -15,6 +17,13 @@ TEST(Ssdp, OnlyTheGatewayItselfCounts) {
     const std::pair<const char*, bool> rgCases[] = {
         {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", true},
         {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.2:5000/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:0/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:-1/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:65536/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:99999999999999999999/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:/x\r\n\r\n", true},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://[::ffff:192.168.1.1]/x\r\n\r\n", false},
+        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1.evil/x\r\n\r\n", false},
         {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1@evil/x\r\n\r\n", false},
         {"HTTP/1.1 200 OK\r\nLOCATION: http://a:b@192.168.1.1/x\r\n\r\n", false},
         {"HTTP/1.1 200 OK\r\nLOCATION: https://192.168.1.1/x\r\n\r\n", false},
@@ -100,6 +109,56 @@ TEST(Igd, AnswersThatAreNoneAreGarbage) {
     EXPECT_EQ(tavo::SoapCode(404, "<e><Body><r/></Body></e>"), tavo::kRouterGarbage);
 }
 
+// A router whose answers are given beforehand.
+class Canned : public tavo::HttpTransport {
+public:
+    tavo::HttpAnswer Get(const tavo::HttpUrl&) override {
+        return {tavo::HttpEnd::kAnswered, 200,
+                "<root><device><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:" + mSzVersion +
+                    "</serviceType><controlURL>/c</controlURL></service></device></root>"};
+    }
+    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string&) override {
+        ++mNPosts;
+        return {tavo::HttpEnd::kAnswered, 200, "<e><Body><r>" + mSzAnswer + "</r></Body></e>"};
+    }
+    std::string mSzVersion = "2";
+    std::string mSzAnswer;
+    int mNPosts = 0;
+};
+
+TEST(Igd, ARangeShowsWhatMakesSense) {
+    const auto fnEntry = [](const char* szPort, const char* szClient) {
+        return std::string("<p:E><p:NewExternalPort>") + szPort + "</p:NewExternalPort><p:NewProtocol>TCP" +
+               "</p:NewProtocol><p:NewInternalPort>5</p:NewInternalPort><p:NewInternalClient>" + szClient +
+               "</p:NewInternalClient></p:E>";
+    };
+    const std::string szGood = fnEntry("1", "192.168.1.5");
+    const std::string szBad = fnEntry("65536", "192.168.1.5") + fnEntry("-1", "192.168.1.5") + fnEntry("2", "evil");
+    const auto fnListing = [](const std::string& szInner) {
+        return "<NewPortListing><![CDATA[<p:List xmlns:p='x'>" + szInner + "</p:List>]]></NewPortListing>";
+    };
+    const std::pair<std::string, size_t> rgCases[] = {
+        {fnListing(szGood), 1},
+        {fnListing(szBad + szGood + szBad), 1},
+        {fnListing(""), 0},
+        {"<NewPortListing>&lt;l&gt;&lt;e/&gt;&lt;/l&gt;</NewPortListing>", 0},
+        {"<NewPortListing><![CDATA[<l><e>]]></NewPortListing>", 0},
+        {"<NewPortListing/>", 0},
+        {"", 0}};
+    for (const auto& [szAnswer, nExpected] : rgCases) {
+        const auto pHttp = std::make_shared<Canned>();
+        pHttp->mSzAnswer = szAnswer;
+        std::vector<RouterMapping> rgMappings;
+        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->ListRange("TCP", 1, 9, rgMappings), 0) << szAnswer;
+        EXPECT_EQ(rgMappings.size(), nExpected) << szAnswer;
+    }
+    const auto pFirst = std::make_shared<Canned>();
+    pFirst->mSzVersion = "1";  // the first generation knows no ranges: it is not even asked
+    std::vector<RouterMapping> rgMappings;
+    EXPECT_NE(tavo::Igd::At({"192.168.1.1", 80, "/"}, pFirst)->ListRange("TCP", 1, 9, rgMappings), 0);
+    EXPECT_EQ(pFirst->mNPosts, 0);
+}
+
 class MemoryRouter : public tavo::Router {
 public:
     int List(std::vector<RouterMapping>& rgMappings) override {
@@ -108,6 +167,17 @@ public:
             rgMappings.push_back(mapping);
         }
         return mNListCode;
+    }
+    int ListRange(const std::string&, uint16_t nFirst, uint16_t nLast,
+                  std::vector<RouterMapping>& rgMappings) override {
+        ++mNCalls;
+        for (const auto& [key, mapping] : mMapTable) {
+            if (mNRangeCode == tavo::kRouterOk && key.second >= nFirst && key.second <= nLast &&
+                key.second != mNHidden) {
+                rgMappings.push_back(mapping);
+            }
+        }
+        return mNRangeCode;
     }
     int Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
         ++mNCalls;
@@ -120,16 +190,26 @@ public:
     }
     int Add(const RouterMapping& mapping) override {
         ++mNCalls;
+        if (mapping.nRouterPort == mNSwallowed) {
+            return tavo::kRouterOk;
+        }
         mMapTable[{mapping.szProtocol, mapping.nRouterPort}] = mapping;
         return tavo::kRouterOk;
     }
     int Remove(const std::string& szProtocol, uint16_t nPort) override {
         ++mNCalls;
+        if (mNRemoveCode != tavo::kRouterOk) {
+            return mNRemoveCode;
+        }
         return mMapTable.erase({szProtocol, nPort}) == 1 ? tavo::kRouterOk : tavo::kRouterNoSuchEntry;
     }
 
     std::map<std::pair<std::string, uint16_t>, RouterMapping> mMapTable;
     int mNListCode = tavo::kRouterOk;
+    int mNRangeCode = tavo::kRouterInvalidAction;
+    int mNRemoveCode = tavo::kRouterOk;
+    int mNHidden = 0;     // not shown in a range
+    int mNSwallowed = 0;  // promised and not kept
     int mNCalls = 0;
 };
 
@@ -168,6 +248,45 @@ TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     tavo::Reconcile(router, rgWanted, kBox, habit, true, fnGoOn);  // leases due: each own one asked for again
     EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), habit.nLease);
     EXPECT_EQ((router.mMapTable[{"TCP", 5}].szDescription), "game");
+}
+
+TEST(Reconcile, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
+    std::vector<RouterMapping> rgWanted;
+    for (uint16_t nPort = 1; nPort <= 10; ++nPort) {
+        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+    }
+    // What the range answers, what it hides, what the router swallows: the calls for a listing, ten
+    // mappings and their proof, and the status of the fifth.
+    const std::tuple<int, int, int, int, const char*> rgCases[] = {
+        {tavo::kRouterOk, 0, 0, 1 + 10 + 1, "1"},
+        {tavo::kRouterOk, 5, 0, 1 + 10 + 1 + 1, "1"},
+        {tavo::kRouterOk, 0, 5, 1 + 10 + 1 + 1, "lost"},
+        {tavo::kRouterInvalidAction, 0, 5, 1 + 10 + 1 + 10, "lost"},
+        {tavo::kRouterTimeout, 0, 0, 1 + 10 + 1 + 10, "1"}};
+    for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] : rgCases) {
+        MemoryRouter router;
+        router.mNRangeCode = nCode;
+        router.mNHidden = nHidden;
+        router.mNSwallowed = nSwallowed;
+        tavo::LeaseHabit habit;
+        const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, [] { return false; });
+        EXPECT_EQ(router.mNCalls, nCalls);
+        ASSERT_EQ(result.rgStatus.size(), 10U);
+        EXPECT_EQ(result.rgStatus[4].second, szFifth);
+        EXPECT_EQ(std::count_if(result.rgStatus.begin(), result.rgStatus.end(),
+                                [](const auto& status) { return status.second == "1"; }),
+                  nSwallowed == 0 ? 10 : 9);
+    }
+}
+
+TEST(Reconcile, WhatTheRouterDoesNotTakeAwayIsReported) {
+    MemoryRouter router;
+    router.Add(Entry(1, 1, kBox, "tavo:old"));
+    router.Add(Entry(2, 9, kBox, "tavo:moved"));
+    router.mNRemoveCode = 606;
+    tavo::LeaseHabit habit;
+    const auto result = tavo::Reconcile(router, {Entry(2, 2, "", "tavo:a")}, kBox, habit, false, [] { return false; });
+    EXPECT_EQ(result.rgStatus, (tavo::StatusList{{"2/tcp", "606"}, {"1/tcp (left over)", "606"}}));
 }
 
 TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {

@@ -6,6 +6,7 @@
 #include <curl/curl.h>
 
 #include <algorithm>
+#include <charconv>
 #include <new>
 
 namespace tavo {
@@ -13,7 +14,6 @@ namespace tavo {
 namespace {
 
 constexpr long kConnectMilliseconds = 3000;
-constexpr long kRequestMilliseconds = 5000;
 constexpr size_t kMaxBody = 256U << 10U;
 
 struct ListFree {
@@ -32,11 +32,18 @@ size_t TakeBody(char* pData, size_t nSize, size_t nCount, void* pUser) {
     return nBytes;
 }
 
+// Asked at least once a second while a request lasts; anything but 0 ends it.
+int AskStop(void* pUser, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
+    const auto& fnStop = *static_cast<const std::function<bool()>*>(pUser);
+    return fnStop && fnStop() ? 1 : 0;
+}
+
 HttpEnd EndOf(CURLcode enCode) {
     switch (enCode) {
         case CURLE_OK:
             return HttpEnd::kAnswered;
         case CURLE_OPERATION_TIMEDOUT:
+        case CURLE_ABORTED_BY_CALLBACK:
             return HttpEnd::kTimeout;
         case CURLE_COULDNT_CONNECT:
         case CURLE_SEND_ERROR:
@@ -82,13 +89,19 @@ std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl) {
         return std::nullopt;
     }
     const std::string szQuery = UrlPart(pUrl.get(), CURLUPART_QUERY);
-    return HttpUrl{UrlPart(pUrl.get(), CURLUPART_HOST), std::stoi(UrlPart(pUrl.get(), CURLUPART_PORT)),
+    const std::string szPort = UrlPart(pUrl.get(), CURLUPART_PORT);
+    uint16_t nPort = 0;
+    if (std::from_chars(szPort.data(), szPort.data() + szPort.size(), nPort).ec != std::errc() || nPort == 0) {
+        return std::nullopt;
+    }
+    return HttpUrl{UrlPart(pUrl.get(), CURLUPART_HOST), nPort,
                    UrlPart(pUrl.get(), CURLUPART_PATH) + (szQuery.empty() ? "" : "?" + szQuery)};
 }
 
 struct HttpClient::Impl {
     CURL* pCurl = curl_easy_init();
     long nLimitMilliseconds = kRequestMilliseconds;
+    std::function<bool()> fnStop;
     ~Impl() { curl_easy_cleanup(pCurl); }
 };
 
@@ -98,6 +111,10 @@ HttpClient::~HttpClient() = default;
 
 void HttpClient::SetLimit(int nMilliseconds) {
     mPImpl->nLimitMilliseconds = std::clamp<long>(nMilliseconds, 1, kRequestMilliseconds);
+}
+
+void HttpClient::SetStop(std::function<bool()> fnStop) {
+    mPImpl->fnStop = std::move(fnStop);
 }
 
 HttpAnswer HttpClient::Get(const HttpUrl& url) {
@@ -131,6 +148,9 @@ HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string
     curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
     curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakeBody);
     curl_easy_setopt(pCurl, CURLOPT_WRITEDATA, &answer.szBody);
+    curl_easy_setopt(pCurl, CURLOPT_NOPROGRESS, 0L);
+    curl_easy_setopt(pCurl, CURLOPT_XFERINFOFUNCTION, &AskStop);
+    curl_easy_setopt(pCurl, CURLOPT_XFERINFODATA, &mPImpl->fnStop);
     if (pSzBody != nullptr) {
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(pSzBody->size()));
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDS, pSzBody->c_str());

@@ -3,6 +3,7 @@
 // proxies, no other host than the one given.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -12,7 +13,7 @@
 
 namespace tavo {
 
-// An http URL taken apart; nothing for another scheme, an unreadable URL or one with an account in it.
+// An http URL taken apart; nothing for another scheme, an unreadable URL, port 0 or an account in it.
 struct HttpUrl {
     std::string szHost;
     int nPort;
@@ -29,18 +30,35 @@ struct HttpAnswer {
     std::string szBody;
 };
 
-// One client keeps its connection open between requests where the router does.
-class TAVO_PLATFORM_API HttpClient {
+// The most that a request takes, unless it was given less.
+inline constexpr int kRequestMilliseconds = 5000;
+
+// What carries requests to a router.
+class TAVO_PLATFORM_API HttpTransport {
+public:
+    virtual ~HttpTransport() = default;
+    virtual HttpAnswer Get(const HttpUrl& url) = 0;
+    virtual HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
+                            const std::string& szBody) = 0;
+    // The most that one request may take from now on.
+    virtual void SetLimit(int /*nMilliseconds*/) {}
+    // Requests end, as timeouts, within a second of the moment from which fnStop answers true.
+    virtual void SetStop(std::function<bool()> /*fnStop*/) {}
+};
+
+// The network. One client keeps its connection open between requests where the router does.
+class TAVO_PLATFORM_API HttpClient : public HttpTransport {
 public:
     HttpClient();
-    ~HttpClient();
+    ~HttpClient() override;
     HttpClient(const HttpClient&) = delete;
     HttpClient& operator=(const HttpClient&) = delete;
 
-    // The most that one request may take from now on.
-    void SetLimit(int nMilliseconds);
-    HttpAnswer Get(const HttpUrl& url);
-    HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders, const std::string& szBody);
+    HttpAnswer Get(const HttpUrl& url) override;
+    HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
+                    const std::string& szBody) override;
+    void SetLimit(int nMilliseconds) override;
+    void SetStop(std::function<bool()> fnStop) override;
 
 private:
     HttpAnswer Perform(const HttpUrl& url, const std::vector<std::string>& rgszHeaders, const std::string* pSzBody);

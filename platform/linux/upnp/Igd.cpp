@@ -263,56 +263,58 @@ int SoapCode(long nHttpCode, const std::string& szXml) {
     return nCode && *nCode > 0 ? *nCode : kRouterGarbage;
 }
 
+std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp) {
+    const HttpAnswer answer = pHttp->Get(location);
+    if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
+        return nullptr;
+    }
+    auto service = ParseDescription(answer.szBody, location);
+    return service ? std::unique_ptr<Igd>(new Igd(std::move(*service), std::move(pHttp))) : nullptr;
+}
+
 std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                               std::string* pSzLocation, int nLocalPort) {
+                               std::string* pSzLocation, int nLocalPort, const std::function<bool()>& fnStop) {
     std::unique_ptr<Igd> pFound;
-    HttpClient http;
     const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(nLimitMilliseconds);
     const auto fnLeft = [&] {
         return static_cast<int>(
             std::chrono::duration_cast<std::chrono::milliseconds>(end - std::chrono::steady_clock::now()).count());
     };
-    const auto fnTry = [&](const HttpUrl& location) {
-        const HttpAnswer answer = http.Get(location);
-        if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
-            return false;
-        }
-        auto service = ParseDescription(answer.szBody, location);
-        if (!service) {
-            return false;
-        }
-        pFound.reset(new Igd(std::move(*service)));
-        if (pSzLocation != nullptr) {
+    const auto fnTry = [&](const HttpUrl& location, int nLimit) {
+        const auto pHttp = std::make_shared<HttpClient>();
+        pHttp->SetStop(fnStop);
+        pHttp->SetLimit(nLimit);
+        pFound = At(location, pHttp);
+        pHttp->SetLimit(kRequestMilliseconds);
+        if (pFound != nullptr && pSzLocation != nullptr) {
             *pSzLocation = location.Text();
         }
-        return true;
+        return pFound != nullptr;
     };
     if (pSzLocation != nullptr && !pSzLocation->empty()) {
         const auto known = ParseHttpUrl(*pSzLocation);
-        http.SetLimit(nLimitMilliseconds / 2);
-        if (known && known->szHost == szGateway && fnTry(*known)) {
+        if (known && known->szHost == szGateway && fnTry(*known, nLimitMilliseconds / 2)) {
             return pFound;
         }
     }
-    SearchGateway(szGateway, szLocal, fnLeft(), nLocalPort, [&](const HttpUrl& location) {
-        http.SetLimit(fnLeft());
-        return fnTry(location);
-    });
+    SearchGateway(
+        szGateway, szLocal, fnLeft(), nLocalPort, [&](const HttpUrl& location) { return fnTry(location, fnLeft()); },
+        fnStop);
     return pFound;
 }
 
 int Igd::Call(const char* szAction, const std::vector<Argument>& rgArguments, std::string& szAnswer) {
     std::string szBody = std::string("<?xml version=\"1.0\"?>\r\n<s:Envelope xmlns:s=\"") + kEnvelope +
                          "\" s:encodingStyle=\"" + kEncoding + "\"><s:Body><u:" + szAction + " xmlns:u=\"" +
-                         mService.szType + "\">";
+                         EscapeXml(mService.szType) + "\">";
     for (const Argument& argument : rgArguments) {
         szBody += std::string("<") + argument.szName + ">" + EscapeXml(argument.szValue) + "</" + argument.szName + ">";
     }
     szBody += std::string("</u:") + szAction + "></s:Body></s:Envelope>\r\n";
-    HttpAnswer answer = mHttp.Post(mService.control,
-                                   {"Content-Type: text/xml; charset=\"utf-8\"",
-                                    "Expect:", "SOAPAction: \"" + mService.szType + "#" + szAction + "\""},
-                                   szBody);
+    HttpAnswer answer = mPHttp->Post(mService.control,
+                                     {"Content-Type: text/xml; charset=\"utf-8\"",
+                                      "Expect:", "SOAPAction: \"" + mService.szType + "#" + szAction + "\""},
+                                     szBody);
     szAnswer = std::move(answer.szBody);
     answer.szBody = szAnswer;
     return CodeOf(answer);

@@ -37,12 +37,18 @@ TAVO_PLATFORM_API int SoapCode(long nHttpCode, const std::string& szXml);
 class TAVO_PLATFORM_API Igd : public Router {
 public:
     // The IGD at the gateway, found within the limit or not at all. pSzLocation (may be null) is tried
-    // first, for half of it at most, and set to what worked. A search lasts as SearchGateway says.
+    // first, for half of it at most, and set to what worked. A search lasts as SearchGateway says. fnStop
+    // is kept for the calls that follow.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                                     std::string* pSzLocation, int nLocalPort = 0);
+                                     std::string* pSzLocation, int nLocalPort = 0,
+                                     const std::function<bool()>& fnStop = {});
+    // The IGD whose description is at a location; null when there is none.
+    static std::unique_ptr<Igd> At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp);
 
     // The most that one call may take from now on.
-    void SetCallLimit(int nMilliseconds) { mHttp.SetLimit(nMilliseconds); }
+    void SetCallLimit(int nMilliseconds) { mPHttp->SetLimit(nMilliseconds); }
+    // What ends calls early from now on, as HttpTransport says.
+    void SetStop(const std::function<bool()>& fnStop) { mPHttp->SetStop(fnStop); }
     // The entry at an index. One that makes no sense comes back disabled and without a protocol.
     int GetAt(int nIndex, RouterMapping& mapping);
     // The router's address on its other side, as it says itself.
@@ -61,12 +67,13 @@ private:
         const char* szName;
         std::string szValue;
     };
-    explicit Igd(IgdService service) : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")) {}
+    Igd(IgdService service, std::shared_ptr<HttpTransport> pHttp)
+        : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")), mPHttp(std::move(pHttp)) {}
     int Call(const char* szAction, const std::vector<Argument>& rgArguments, std::string& szAnswer);
 
     IgdService mService;
     bool mBlRanges;  // services of the second generation show ranges, unless they once could not
-    HttpClient mHttp;
+    std::shared_ptr<HttpTransport> mPHttp;
 };
 
 }  // namespace tavo

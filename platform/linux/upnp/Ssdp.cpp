@@ -27,6 +27,8 @@ constexpr char kGroup[] = "239.255.255.250";
 constexpr size_t kMaxAnswer = 4096;
 constexpr size_t kMaxReason = 200;
 constexpr size_t kMaxLocations = 16;  // a gateway that names more is playing games
+constexpr int kMaxRefusalsLogged = 8;
+constexpr int kStopPollMilliseconds = 250;
 // UDP gets lost: each question is asked again at these times after the first.
 constexpr int kAskAtMilliseconds[] = {0, 150, 600, 1500, 3000};
 constexpr auto kSilence = std::chrono::milliseconds(3000);
@@ -82,8 +84,8 @@ bool IsAddressForDevices(const std::string& szHost) {
     return !blLoopback && !blLinkLocal && nHost != 0;
 }
 
-// Where one answer from the gateway points; refusals are logged. blHeard: it said something at all.
-std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHeard) {
+// Where one answer from the gateway points; the first refusals are logged. blHeard: it said something at all.
+std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHeard, int& nRefused) {
     char szAnswer[kMaxAnswer];
     sockaddr_in from = {};
     socklen_t nLength = sizeof(from);
@@ -94,7 +96,7 @@ std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHea
     blHeard = true;
     std::string szReason;
     auto location = LocationOf({szAnswer, static_cast<size_t>(nRead)}, szGateway, szReason);
-    if (!location) {
+    if (!location && ++nRefused <= kMaxRefusalsLogged) {
         syslog(LOG_WARNING, "router's discovery answer refused: %s", szReason.c_str());
     }
     return location;
@@ -130,7 +132,7 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
 }
 
 bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
-                   const std::function<bool(const HttpUrl&)>& fnTry) {
+                   const std::function<bool(const HttpUrl&)>& fnTry, const std::function<bool()>& fnStop) {
     const Descriptor fd = OpenSocket(szLocal, nLocalPort);
     if (fd.Get() < 0) {
         return false;
@@ -141,7 +143,8 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
         std::min(limit, start + std::chrono::milliseconds(*std::rbegin(kAskAtMilliseconds)) + kSilence);
     std::set<std::string> setSeen;
     size_t nAsked = 0;
-    while (Clock::now() < end && setSeen.size() < kMaxLocations) {
+    int nRefused = 0;
+    while (Clock::now() < end && setSeen.size() < kMaxLocations && !(fnStop && fnStop())) {
         Clock::time_point wake = end;
         if (nAsked < std::size(kAskAtMilliseconds)) {
             wake = std::min(end, start + std::chrono::milliseconds(kAskAtMilliseconds[nAsked]));
@@ -152,11 +155,11 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
             }
         }
         pollfd waiting = {fd.Get(), POLLIN, 0};
-        if (poll(&waiting, 1, MillisecondsUntil(wake) + 1) <= 0) {
+        if (poll(&waiting, 1, std::min(MillisecondsUntil(wake) + 1, kStopPollMilliseconds)) <= 0) {
             continue;
         }
         bool blHeard = false;
-        const std::optional<HttpUrl> location = Receive(fd.Get(), szGateway, blHeard);
+        const std::optional<HttpUrl> location = Receive(fd.Get(), szGateway, blHeard, nRefused);
         if (location && setSeen.insert(location->Text()).second && fnTry(*location)) {
             return true;
         }

@@ -21,8 +21,8 @@ TAVO_PLATFORM_API std::optional<HttpUrl> LocationOf(std::string_view szAnswer, c
 // true. False when none did within nLimitMilliseconds, and before that when the gateway has been silent
 // for three seconds after the last question: it had three times what the question allows for the answer,
 // and a box without a UPnP router is not made to wait. Asks from the local port nLocalPort, from any
-// other when that one is taken or 0.
+// other when that one is taken or 0. Ends soon after fnStop, where there is one, answers true.
 bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
-                   const std::function<bool(const HttpUrl&)>& fnTry);
+                   const std::function<bool(const HttpUrl&)>& fnTry, const std::function<bool()>& fnStop);
 
 }  // namespace tavo

@@ -39,6 +39,7 @@ constexpr int kExitUsage = 2;
 constexpr char kMarkerDir[] = "/tmp";
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
+constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
 
 class SignalQueue {
@@ -141,6 +142,7 @@ private:
     SignalQueue mSignals;
     Descriptor mFdEvents;
     bool mBlRequested = true;  // the start counts as a request
+    int mNCut = 0;             // passes in a row that a newer request may have ended early
     Clock::time_point mNext = Clock::now();
 };
 
@@ -159,8 +161,13 @@ void Frame::Wait() {
 
 void Frame::RunPass() {
     WritePidFile(mNames);
-    // A stop or a newer request ends a pass early: what it would report is out of date.
-    const int nSeconds = mMapper.Run(mBlRequested, [this] { return mSignals.IsStop() || mSignals.HasRequest(); });
+    // A stop or a newer request ends a pass early: what it would report is out of date. But requests
+    // without end must not keep the router from ever being brought in line.
+    const bool blWhole = mNCut >= kCutPasses;
+    const int nSeconds =
+        mMapper.Run(mBlRequested, [this, blWhole] { return mSignals.IsStop() || (!blWhole && mSignals.HasRequest()); });
+    mNCut = mSignals.HasRequest() && !blWhole ? mNCut + 1 : 0;
+
     mNext = Clock::now() + std::chrono::seconds(nSeconds);
     mBlRequested = false;
 }

@@ -55,6 +55,7 @@ private:
     LeaseHabit& mHabit;
     bool mBlRenew;
     std::map<Key, RouterMapping> mMapTable;
+    std::map<Key, int> mMapKept;  // ours and unwanted, and the code with which the router kept it
     PassResult mResult;
     PassGuard mGuard;
     size_t mNRead = 0;  // statuses up to here are not kWritten
@@ -94,6 +95,11 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
         }
     }
     ReadBack(rgWanted);
+    for (const auto& [key, nKept] : mMapKept) {
+        if (!mapWanted.contains(key)) {
+            mResult.rgStatus.emplace_back(MappingName(mMapTable[key]) + " (left over)", CodeText(nKept));
+        }
+    }
     return mResult;
 }
 
@@ -106,7 +112,12 @@ void Pass::RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted) {
             continue;
         }
         const int nCode = Note(mRouter.Remove(it->first.first, it->first.second));
-        it = nCode == kRouterOk || nCode == kRouterNoSuchEntry ? mMapTable.erase(it) : std::next(it);
+        if (nCode == kRouterOk || nCode == kRouterNoSuchEntry) {
+            it = mMapTable.erase(it);
+        } else {
+            mMapKept.emplace(it->first, nCode);
+            ++it;
+        }
     }
 }
 
@@ -116,7 +127,8 @@ std::string Pass::Place(const RouterMapping& wanted) {
         return Create(wanted);
     }
     if (!Serves(it->second, wanted)) {
-        return CodeText(kRouterConflict);
+        const auto kept = mMapKept.find(it->first);
+        return CodeText(kept == mMapKept.end() ? kRouterConflict : kept->second);
     }
     if (!IsOwn(it->second)) {
         return "1";  // another program of the box made just this one; it is that program's to renew

@@ -19,6 +19,7 @@ namespace {
 constexpr mode_t kResultMode = 0644;
 constexpr int kFailuresToRediscover = 3;
 constexpr int kRetrySeconds = 10;
+constexpr int kWithdrawTries = 3;
 constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
 constexpr size_t kAddressSize = 16;
 
@@ -145,8 +146,14 @@ void RuleMapper::WriteResults(PassResult result) const {
 }
 
 void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
-    if (mTurn.Take([] { return false; }) && FindGateway()) {
-        Map({}, false, fnStop);
+    if (!mTurn.Take([] { return false; })) {
+        return;
+    }
+    for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
+        const PassResult result = Map({}, false, fnStop);
+        if (result.nTransport == kRouterOk && result.rgStatus.empty()) {
+            return;
+        }
     }
 }
 

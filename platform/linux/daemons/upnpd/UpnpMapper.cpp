@@ -33,9 +33,9 @@ void UpnpMapper::LostRouter() {
 }
 
 // Where does the router's service live. False: there is none that we can use.
-bool UpnpMapper::FindRouter() {
+bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
-        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation);
+        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation, 0, fnStop);
         if (mPIgd != nullptr) {
             Remember();
         }
@@ -50,9 +50,12 @@ void UpnpMapper::Remember() const {
 
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool blRenew,
                                const std::function<bool()>& fnStop) {
-    if (!FindRouter()) {
-        return Failed(rgWanted, "noigd");
+    if (!FindRouter(fnStop)) {
+        PassResult result = Failed(rgWanted, "noigd");
+        result.blStopped = fnStop();
+        return result;
     }
+    mPIgd->SetStop(fnStop);
     const bool blPermanentOnly = mHabit.blPermanentOnly;
     const PassResult result = Reconcile(*mPIgd, rgWanted, Box(), mHabit, blRenew, fnStop);
     if (blPermanentOnly != mHabit.blPermanentOnly) {

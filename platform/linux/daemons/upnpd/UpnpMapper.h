@@ -21,7 +21,7 @@ private:
     void NewGateway() override;
     void LostRouter() override;
 
-    bool FindRouter();
+    bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, bool blRenew, const std::function<bool()>& fnStop);
 
