@@ -134,12 +134,15 @@ bool TakeBool(const Json::Value* pJsValue, const char* szWrongType, int nLine, b
     return true;
 }
 
-// Gives up a list that could not be finished.
-void FreeUnfinished(__tag_TAVO_ROUTERDB_LIST* pHead) {
-    if (!RouterDB::FreeList(pHead)) {
-        LogError("%s:%d FreeList(head) failed", kFile, __LINE__);
+// A list that is given up unless it was finished.
+struct UnfinishedDeleter {
+    void operator()(__tag_TAVO_ROUTERDB_LIST* pHead) const {
+        if (!RouterDB::FreeList(pHead)) {
+            LogError("%s:%d FreeList(head) failed", kFile, __LINE__);
+        }
     }
-}
+};
+using Models = std::unique_ptr<__tag_TAVO_ROUTERDB_LIST, UnfinishedDeleter>;
 
 bool FillModel(__tag_TAVO_ROUTERDB_LIST& model, const char* szName) {
     using tavo::lib::FillText;
@@ -239,26 +242,30 @@ bool RouterDB::List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList) {
         TLIBCSzList* pNamesRaw = nullptr;
         const int nNames = RouterDBList(&pNamesRaw);
         const std::unique_ptr<TLIBCSzList, NameListDeleter> pNames(pNamesRaw);
-        __tag_TAVO_ROUTERDB_LIST* pHead = nullptr;
-        __tag_TAVO_ROUTERDB_LIST** ppTail = &pHead;
+        Models pHead;
+        __tag_TAVO_ROUTERDB_LIST* pTail = nullptr;
         for (int i = 0; i < nNames; ++i) {
             const char* szName = TLIBCSzListGet(pNames.get(), i);
             if (szName == nullptr) {
                 continue;
             }
-            *ppTail = static_cast<__tag_TAVO_ROUTERDB_LIST*>(std::calloc(1, sizeof(__tag_TAVO_ROUTERDB_LIST)));
-            if (*ppTail == nullptr) {
+            auto* pNode =
+                static_cast<__tag_TAVO_ROUTERDB_LIST*>(std::calloc(1, sizeof(__tag_TAVO_ROUTERDB_LIST)));
+            if (pNode == nullptr) {
                 LogError("%s:%d malloc failed", kFile, __LINE__);
-                FreeUnfinished(pHead);
                 return false;
             }
-            if (!FillModel(**ppTail, szName)) {
-                FreeUnfinished(pHead);
+            if (pTail == nullptr) {
+                pHead.reset(pNode);
+            } else {
+                pTail->pNext = pNode;
+            }
+            pTail = pNode;
+            if (!FillModel(*pNode, szName)) {
                 return false;
             }
-            ppTail = &(*ppTail)->pNext;
         }
-        *pplRouterDBList = pHead;
+        *pplRouterDBList = pHead.release();
         return true;
     });
 }

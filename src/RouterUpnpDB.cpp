@@ -29,12 +29,15 @@ bool LookupBoth(const std::string& szSection, const char* szKey, char (&szValue)
     return Lookup(kDb, szSection, szKey, szValue) || Lookup(kUserDb, szSection, szKey, szValue);
 }
 
+// A location that is too long for the command is refused: a cut command is another command.
 bool Download(const char* szName) {
+    const char* szLocation = GetRouterDBPath();
+    const std::string szQuoted = tavo::lib::InQuotes(szLocation == nullptr ? "" : szLocation);
     char szCommand[tavo::lib::kCommandSize] = {};
     const int nLength =
         std::snprintf(szCommand, sizeof(szCommand), "/usr/tavo/bin/wget '%s/%s' -O %s/%s >/dev/null 2>&1",
-                      GetRouterDBPath(), szName, kDir, szName);
-    if (nLength < 0 || TLIBCSystem(szCommand) != 0) {
+                      szQuoted.c_str(), szName, kDir, szName);
+    if (nLength < 0 || static_cast<size_t>(nLength) >= sizeof(szCommand) || TLIBCSystem(szCommand) != 0) {
         LogError("%s:%d update upnp router info failed", kFile, __LINE__);
         return false;
     }
@@ -104,20 +107,22 @@ bool RouterUpnpDB::GetPfpath(std::string& pfpath) {
 }
 
 bool RouterUpnpDB::Update(int& nVersion) {
-    if (!Download("routersdk_version")) {
-        return false;
-    }
-    const int nCurrent = IGetCurrSyntaxVersion();
-    char szVersion[kVersionSize] = {};
-    if (TLIBCFileGetKeyValue(kVersionFile, "version", szVersion, sizeof(szVersion), 0) < 0) {
-        LogError("%s:%d can not read router sdk version", kFile, __LINE__);
-        return false;
-    }
-    const int nServer = tavo::lib::ToInt(szVersion);
-    // A database of another version is left alone: this tool could not read it.
-    if (nCurrent == nServer && !Download("router_upnp.db")) {
-        return false;
-    }
-    nVersion = nServer;
-    return true;
+    return AtBorder(false, [&] {
+        if (!Download("routersdk_version")) {
+            return false;
+        }
+        const int nCurrent = IGetCurrSyntaxVersion();
+        char szVersion[kVersionSize] = {};
+        if (TLIBCFileGetKeyValue(kVersionFile, "version", szVersion, sizeof(szVersion), 0) < 0) {
+            LogError("%s:%d can not read router sdk version", kFile, __LINE__);
+            return false;
+        }
+        const int nServer = tavo::lib::ToInt(szVersion);
+        // A database of another version is left alone: this tool could not read it.
+        if (nCurrent == nServer && !Download("router_upnp.db")) {
+            return false;
+        }
+        nVersion = nServer;
+        return true;
+    });
 }

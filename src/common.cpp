@@ -4,17 +4,21 @@
 #include "common.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <climits>
 #include <cstdarg>
 #include <cstdlib>
 #include <cstring>
+#include <utility>
 
 #include "tavo/net.h"
 #include "tavo/task.h"
@@ -33,6 +37,10 @@ constexpr size_t kModelSize = 512;
 constexpr size_t kVersionSize = 1024;
 constexpr size_t kPathSize = 4096;
 constexpr size_t kToolLineSize = 1024;
+constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
+constexpr std::string_view kVersionKey = "syntax version";
+constexpr int kToolSeconds = 10;            // a tool that has not answered by then hangs
+constexpr int kToolLookMilliseconds = 100;  // between two looks whether it has ended
 
 // The two refusals that every accessor of a rule section begins with.
 bool HasHash(const TAVO_PF_CONF* pConf) {
@@ -47,8 +55,113 @@ bool HasHash(const TAVO_PF_CONF* pConf) {
     return true;
 }
 
-struct PipeCloser {
-    void operator()(FILE* pPipe) const { pclose(pPipe); }
+// A shell command whose output is read through a pipe. It shares no other descriptor with us, so that one
+// that stays alive holds no lock of ours; one that has not ended within kToolSeconds is killed.
+class Tool {
+public:
+    ~Tool();
+    bool Start(const char* szCommand);
+    // What it printed next; 0: it has ended, or its time has.
+    ssize_t Read(char* szBlock, size_t nSize);
+
+private:
+    using Clock = std::chrono::steady_clock;
+
+    int MillisecondsLeft() const;
+    // Whether the command itself is over; what it left behind may still hold the pipe.
+    bool HasEnded();
+
+    int mFd = -1;
+    pid_t mPid = -1;
+    Clock::time_point mEnd;
+};
+
+bool Tool::Start(const char* szCommand) {
+    int rgFd[2];
+    if (pipe2(rgFd, O_CLOEXEC) != 0) {
+        return false;
+    }
+    mFd = rgFd[0];
+    mEnd = Clock::now() + std::chrono::seconds(kToolSeconds);
+    mPid = fork();
+    if (mPid == 0) {
+        setpgid(0, 0);
+        dup2(rgFd[1], STDOUT_FILENO);
+        fcntl(STDOUT_FILENO, F_SETFD, 0);  // where the pipe itself had that number
+        closefrom(STDERR_FILENO + 1);
+        execl("/bin/sh", "sh", "-c", szCommand, nullptr);
+        _exit(127);
+    }
+    close(rgFd[1]);
+    return mPid > 0;
+}
+
+int Tool::MillisecondsLeft() const {
+    const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mEnd - Clock::now()).count();
+    return static_cast<int>(std::clamp<int64_t>(nLeft, 0, kToolLookMilliseconds));
+}
+
+bool Tool::HasEnded() {
+    if (mPid > 0 && waitpid(mPid, nullptr, WNOHANG) != 0) {
+        mPid = -1;
+    }
+    return mPid < 0;
+}
+
+ssize_t Tool::Read(char* szBlock, size_t nSize) {
+    for (bool blLast = false;;) {
+        const int nLeft = MillisecondsLeft();
+        pollfd waiting = {mFd, POLLIN, 0};
+        if (nLeft > 0 && poll(&waiting, 1, blLast ? 0 : nLeft) > 0) {
+            return std::max<ssize_t>(read(mFd, szBlock, nSize), 0);
+        }
+        if (nLeft == 0 || blLast) {
+            return 0;
+        }
+        blLast = HasEnded();  // one more look: it may have printed just before
+    }
+}
+
+Tool::~Tool() {
+    if (mFd >= 0) {
+        close(mFd);
+    }
+    int nLeft = 0;
+    while (!HasEnded() && (nLeft = MillisecondsLeft()) > 0) {
+        usleep(1000);
+    }
+    if (mPid > 0) {
+        kill(-mPid, SIGKILL);
+        waitpid(mPid, nullptr, 0);
+    }
+}
+
+// Finds the version in what the tool prints; the last line that gives one wins.
+class VersionLines {
+public:
+    void Take(std::string_view szBlock) {
+        for (const char c : szBlock) {
+            if (c == '\n') {
+                EndLine();
+            } else if (mNLength < sizeof(mSzLine) - 1) {
+                mSzLine[mNLength++] = c;
+            }
+        }
+    }
+    void EndLine() {
+        mSzLine[std::exchange(mNLength, 0)] = '\0';
+        const bool blKey = std::string_view(mSzLine).starts_with(kVersionKey);
+        const char* szNumber = blKey ? std::strchr(mSzLine + kVersionKey.size(), '=') : nullptr;
+        if (szNumber != nullptr) {
+            mNVersion = tavo::lib::ToInt(szNumber + 1);
+        }
+    }
+    int Version() const { return mNVersion; }
+
+private:
+    char mSzLine[kToolLineSize] = {};
+    size_t mNLength = 0;
+    int mNVersion = -1;
 };
 
 void RenameLogged(const char* szFrom, const char* szTo, int nLine) {
@@ -147,6 +260,22 @@ bool StartFresh(const tavo::lib::DaemonControl& control) {
     return false;
 }
 
+// The version that a model's generic description was written for. False: it has none.
+bool ReadGenericVersion(const std::string& szBrand, const std::string& szModel, std::string& szVersion) {
+    if (!tavo::lib::IsPathPart(szBrand) || !tavo::lib::IsPathPart(szModel)) {
+        return false;
+    }
+    char szPath[kPathSize] = {};
+    char szValue[kVersionSize] = {};
+    std::snprintf(szPath, sizeof(szPath), "%s/%s/%s/%s", tavo::lib::kRouterDbDir, szBrand.c_str(), szModel.c_str(),
+                  "generic");
+    if (TLIBCFileGetKeyValue(szPath, "version", szValue, sizeof(szValue), 0) < 1) {
+        return false;
+    }
+    szVersion = szValue;
+    return true;
+}
+
 int ReadText(std::string& szValue, const char* szKey, const TAVO_PF_CONF* pConf) {
     const char* szStored = TLIBCSzHashGetValue(pConf->pHash, szKey);
     if (szStored == nullptr) {
@@ -200,6 +329,18 @@ std::string TaskText(const char* szId, const char* szName) {
         task.reload();
         return task.getStringProperty(szName, "");
     });
+}
+
+bool IsPathPart(std::string_view szPart) {
+    return !szPart.empty() && szPart != "." && szPart != ".." && szPart.find('/') == std::string_view::npos;
+}
+
+std::string InQuotes(std::string_view szText) {
+    std::string szOut;
+    for (const char c : szText) {
+        szOut += c == '\'' ? std::string("'\\''") : std::string(1, c);
+    }
+    return szOut;
 }
 
 int ToInt(const char* szText) {
@@ -284,6 +425,8 @@ int lock_file(const char* szPath, int& fd) {
     if (fd < 0) {
         return 0;
     }
+    // A program that the caller starts with it open would hold the lock for as long as it lives.
+    fcntl(fd, F_SETFD, FD_CLOEXEC);
     return flock(fd, LOCK_EX | LOCK_NB) == 0 ? 1 : 0;
 }
 
@@ -319,27 +462,22 @@ bool SplitRouterName(char* szName, std::string& brand, std::string& model, std::
             LogError("%s:%d incorrect information", kFile, __LINE__);
             return false;
         }
-        const std::string szBrand = szWhole.substr(0, std::min(nSeparator, kBrandSize - 1));
+        std::string szBrand = szWhole.substr(0, std::min(nSeparator, kBrandSize - 1));
         const size_t nModel = nSeparator + 2;
         const size_t nOpen = szWhole.find('(', nSeparator);
         const size_t nModelLength = nOpen == std::string::npos ? nOpen : nOpen - nModel;
-        const std::string szModel = szWhole.substr(nModel, std::min(nModelLength, kModelSize - 1));
-        char szVersion[kVersionSize] = {};
+        std::string szModel = szWhole.substr(nModel, std::min(nModelLength, kModelSize - 1));
+        std::string szVersion;
         if (nOpen != std::string::npos) {
             const std::string szRest = szWhole.substr(nOpen + 1);
-            std::snprintf(szVersion, sizeof(szVersion), "%s", szRest.substr(0, szRest.rfind(')')).c_str());
-        } else {
-            char szPath[kPathSize] = {};
-            std::snprintf(szPath, sizeof(szPath), "%s/%s/%s/%s", tavo::lib::kRouterDbDir, szBrand.c_str(),
-                          szModel.c_str(), "generic");
-            if (TLIBCFileGetKeyValue(szPath, "version", szVersion, sizeof(szVersion), 0) < 1) {
-                LogError("%s:%d incorrect information", kFile, __LINE__);
-                return false;
-            }
+            szVersion = szRest.substr(0, std::min(szRest.rfind(')'), kVersionSize - 1));
+        } else if (!ReadGenericVersion(szBrand, szModel, szVersion)) {
+            LogError("%s:%d incorrect information", kFile, __LINE__);
+            return false;
         }
-        brand = szBrand;
-        model = szModel;
-        version = szVersion;
+        brand.swap(szBrand);
+        model.swap(szModel);
+        version.swap(szVersion);
         return true;
     });
 }
@@ -357,24 +495,18 @@ bool IsGenericRouterName(bool& isGeneric, char* szName) {
 }
 
 int IGetCurrSyntaxVersion() {
-    static constexpr char kKey[] = "syntax version";
-    const std::unique_ptr<FILE, PipeCloser> pTool(popen("/usr/tavo/bin/tavoportforward --version", "r"));
-    if (!pTool) {
+    Tool tool;
+    if (!tool.Start(kVersionCommand)) {
         LogError("%s:%d popen tavoportforward error", kFile, __LINE__);
         return -1;
     }
-    int nVersion = -1;
-    char szLine[kToolLineSize];
-    while (std::fgets(szLine, sizeof(szLine), pTool.get()) != nullptr) {
-        if (std::strncmp(szLine, kKey, sizeof(kKey) - 1) != 0) {
-            continue;
-        }
-        const char* szNumber = std::strchr(szLine + sizeof(kKey) - 1, '=');
-        if (szNumber != nullptr) {
-            nVersion = tavo::lib::ToInt(szNumber + 1);
-        }
+    VersionLines lines;
+    char szBlock[kToolLineSize];
+    for (ssize_t nRead = 0; (nRead = tool.Read(szBlock, sizeof(szBlock))) > 0;) {
+        lines.Take({szBlock, static_cast<size_t>(nRead)});
     }
-    return nVersion;
+    lines.EndLine();
+    return lines.Version();
 }
 
 namespace PF_CONF {

@@ -9,6 +9,7 @@
 #include <memory>
 #include <new>
 #include <string>
+#include <string_view>
 
 #include "libtavoportmap.h"
 #include "tavo/core.h"
@@ -53,12 +54,13 @@ struct HashDeleter {
 };
 using Hash = std::unique_ptr<TLIBCSzHash, HashDeleter>;
 
-// Calls fnAnswer at the library's border: nothing that it throws (memory that ran out) crosses.
+// Calls fnAnswer at the library's border: nothing that it throws (memory that ran out, or whatever a
+// caller's callback throws) crosses.
 template <typename Result, typename Function>
 Result AtBorder(Result failure, Function fnAnswer) noexcept {
     try {
         return fnAnswer();
-    } catch (const std::exception&) {
+    } catch (...) {
         return failure;
     }
 }
@@ -107,6 +109,12 @@ private:
 
 // One text of a record of kTaskOwner's, read anew; empty when there is none.
 std::string TaskText(const char* szId, const char* szName);
+
+// One step down in a directory tree, and never up or sideways.
+bool IsPathPart(std::string_view szPart);
+
+// The text as it stands between single quotes of a shell command, which it cannot leave.
+std::string InQuotes(std::string_view szText);
 
 // Decimal number of a text as strtol reads it; values outside int are clamped.
 int ToInt(const char* szText);

@@ -80,8 +80,13 @@ int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szVal
             return 1;
         }
         Entry entry{szKey, std::move(szCopy)};
-        pHash->mapIndex.emplace(szKey, pHash->rgEntries.size());
         pHash->rgEntries.push_back(std::move(entry));
+        try {
+            pHash->mapIndex.emplace(szKey, pHash->rgEntries.size() - 1);
+        } catch (...) {
+            pHash->rgEntries.pop_back();
+            throw;
+        }
         return 1;
     });
 }

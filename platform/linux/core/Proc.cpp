@@ -1,4 +1,4 @@
-// Finds, signals and starts processes. Relies on /proc, posix_spawn and close_range.
+// Finds, signals and starts processes. Relies on /proc, posix_spawn and closefrom.
 // Promises: children get no descriptor above standard error and default signals; TLIBCExec leaves no
 // zombie; zombies do not count as alive.
 #include <dirent.h>
@@ -142,24 +142,27 @@ void ResetSignals() {
     sigprocmask(SIG_SETMASK, &none, nullptr);
 }
 
+[[noreturn]] void ReportAndExit(int fdReport) {
+    const int nErrno = errno;
+    const ssize_t nWritten = write(fdReport, &nErrno, sizeof(nErrno));
+    _exit(nWritten == sizeof(nErrno) ? 127 : 126);
+}
+
 // In the grandchild: becomes the program, or writes errno to the pipe.
 [[noreturn]] void BecomeProgram(char* const* rgszArguments, int fdReport) {
     ResetSignals();
+    // The report pipe moves to a fixed place, so that all above it can be closed in one call; and first,
+    // for in a caller without standard streams it may be one of them.
+    constexpr int kReport = STDERR_FILENO + 1;
+    dup2(fdReport, kReport);
+    fcntl(kReport, F_SETFD, FD_CLOEXEC);
     const int fdNull = open("/dev/null", O_RDWR);
     for (int fd = STDIN_FILENO; fdNull >= 0 && fd <= STDERR_FILENO; ++fd) {
         dup2(fdNull, fd);
     }
-    // The report pipe moves to a fixed place, so that all above it can be closed in one call.
-    constexpr int kReport = STDERR_FILENO + 1;
-    if (fdReport != kReport) {
-        dup2(fdReport, kReport);
-    }
-    fcntl(kReport, F_SETFD, FD_CLOEXEC);
-    close_range(kReport + 1, ~0U, 0);
+    closefrom(kReport + 1);
     execv(rgszArguments[0], rgszArguments);
-    const int nErrno = errno;
-    const ssize_t nWritten = write(kReport, &nErrno, sizeof(nErrno));
-    _exit(nWritten == sizeof(nErrno) ? 127 : 126);
+    ReportAndExit(kReport);
 }
 
 int WaitFor(pid_t pid) {
@@ -176,7 +179,7 @@ class SpawnSetup {
 public:
     SpawnSetup() {
         posix_spawn_file_actions_init(&mActions);
-        posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
+        mNErr = posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
         posix_spawnattr_init(&mAttributes);
         sigset_t all;
         sigset_t none;
@@ -193,9 +196,12 @@ public:
     SpawnSetup(const SpawnSetup&) = delete;
     SpawnSetup& operator=(const SpawnSetup&) = delete;
 
-    // The child's pid, or -1.
+    // The child's pid, or -1; rather none than one that could hold our descriptors.
     pid_t Spawn(const char* szPath, char* const* rgszArguments) const {
         pid_t pid = -1;
+        if (mNErr != 0) {
+            return pid;
+        }
         const int nErrno = posix_spawn(&pid, szPath, &mActions, &mAttributes, rgszArguments, environ);
         return nErrno == 0 ? pid : -1;
     }
@@ -203,6 +209,7 @@ public:
 private:
     posix_spawn_file_actions_t mActions;
     posix_spawnattr_t mAttributes;
+    int mNErr = 0;
 };
 
 }  // namespace
@@ -272,15 +279,19 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
         if (pidProgram == 0) {
             BecomeProgram(rgszArguments, rgFdPipe[1]);
         }
-        _exit(pidProgram < 0 ? 1 : 0);
+        if (pidProgram < 0) {
+            ReportAndExit(rgFdPipe[1]);
+        }
+        _exit(0);
     }
     fdWrite.Reset();
-    const int nChild = WaitFor(pid);
+    WaitFor(pid);
     int nErrno = 0;
     ssize_t nRead = 0;
     while ((nRead = read(fdRead.Get(), &nErrno, sizeof(nErrno))) < 0 && errno == EINTR) {
     }
-    if (nChild != 0 || nRead != 0) {
+    // The pipe alone tells: a caller that ignores SIGCHLD gets no exit status.
+    if (nRead != 0) {
         errno = nErrno;
         return Fail(TLIBC_ERR_EXEC, __LINE__);
     }

@@ -10,6 +10,7 @@
 #include <cstring>
 #include <filesystem>
 #include <memory>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -61,14 +62,20 @@ std::string GenericVersion(const fs::path& model) {
     return TLIBCFileGetKeyValue(generic.c_str(), "version", szVersion, sizeof(szVersion), 0) >= 1 ? szVersion : "";
 }
 
+void Push(TLIBCSzList* pList, const std::string& szName) {
+    if (TLIBCSzListPush(pList, szName.c_str()) < 0) {
+        throw std::bad_alloc();  // a list is whole or absent
+    }
+}
+
 void ListModel(TLIBCSzList* pList, const std::string& szBrand, const std::string& szModel, const fs::path& model) {
     const std::string szName = szBrand + ": " + szModel;
     if (!GenericVersion(model).empty()) {
-        TLIBCSzListPush(pList, szName.c_str());
+        Push(pList, szName);
     }
     for (const std::string& szVersion : Directories(model)) {
         if (IsFile(model / szVersion / "router.des")) {
-            TLIBCSzListPush(pList, (szName + "(" + szVersion + ")").c_str());
+            Push(pList, szName + "(" + szVersion + ")");
         }
     }
 }
@@ -234,8 +241,10 @@ int TAVOPFRouterDBUpdate() {
 const char* GetRouterDBPath() {
     static thread_local char szLocation[kLocationSize];
     TLIBPlatformSettingGet("download", "database_url", "http://localhost/tavo", szLocation, sizeof(szLocation));
-    // The location stands between quotes in commands: one that could leave them is no location.
-    if (std::strpbrk(szLocation, "'\\\n\r") != nullptr || szLocation[0] == '-') {
+    // The location stands between quotes in commands: one that could leave them is no location, nor is one
+    // that was cut.
+    if (std::strpbrk(szLocation, "'\\\n\r") != nullptr || szLocation[0] == '-' ||
+        std::strlen(szLocation) == sizeof(szLocation) - 1) {
         szLocation[0] = '\0';
     }
     return szLocation;

@@ -53,8 +53,10 @@ void RecoverAside(const char* szPath) {
 }
 
 TAVO_PF_CONF* Load(const char* szPath) {
-    RecoverAside(szPath);
-    return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] { return tavo::LoadConfList(szPath).release(); });
+    return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] {
+        RecoverAside(szPath);
+        return tavo::LoadConfList(szPath).release();
+    });
 }
 
 bool IsListed(std::string_view szName, std::string_view szIdList) {
