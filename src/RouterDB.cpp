@@ -249,8 +249,7 @@ bool RouterDB::List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList) {
             if (szName == nullptr) {
                 continue;
             }
-            auto* pNode =
-                static_cast<__tag_TAVO_ROUTERDB_LIST*>(std::calloc(1, sizeof(__tag_TAVO_ROUTERDB_LIST)));
+            auto* pNode = static_cast<__tag_TAVO_ROUTERDB_LIST*>(std::calloc(1, sizeof(__tag_TAVO_ROUTERDB_LIST)));
             if (pNode == nullptr) {
                 LogError("%s:%d malloc failed", kFile, __LINE__);
                 return false;

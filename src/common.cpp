@@ -382,7 +382,7 @@ bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
         }
         return false;
     }
-    const bool blWritten = fnWrite();
+    const bool blWritten = AtBorder(false, fnWrite);  // whatever happens in it, the old file comes back
     if (!blWritten) {
         LogError("%s:%d save config failed", kFile, __LINE__);
     }

@@ -3,9 +3,13 @@
 #include <gtest/gtest.h>
 #include <syslog.h>
 
+#include <cerrno>
 #include <cstdarg>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <ctime>
+#include <new>
 
 #include "tavo/portforward.h"
 #include "world.h"
@@ -16,10 +20,58 @@ std::string gSzGateway = "192.168.1.1";
 int gNSlept = 0;
 std::function<void()> gFnOnSleep;
 std::function<int()> gFnOnConfSet;
+int gNClockStep = 0;
+long gNGoodAllocations = -1;
+bool gBlOneFailure = false;
+bool gBlAllocationFailed = false;
+int OwnMemory::nDepth = 0;
+
+namespace {
+
+bool AllocationFails() {
+    if (gNGoodAllocations < 0 || OwnMemory::nDepth > 0 || gNGoodAllocations-- > 0) {
+        return false;
+    }
+    gNGoodAllocations = gBlOneFailure ? -1 : 0;
+    gBlAllocationFailed = true;
+    errno = ENOMEM;
+    return true;
+}
+
+}  // namespace
+
+#ifdef __SANITIZE_ADDRESS__
+void* operator new(size_t nSize) {
+    void* pBlock = AllocationFails() ? nullptr : std::malloc(nSize);
+    return pBlock == nullptr ? throw std::bad_alloc() : pBlock;
+}
+void* operator new(size_t nSize, const std::nothrow_t& /*tag*/) noexcept {
+    return AllocationFails() ? nullptr : std::malloc(nSize);
+}
+void operator delete(void* pBlock) noexcept {
+    std::free(pBlock);
+}
+void operator delete(void* pBlock, size_t /*nSize*/) noexcept {
+    std::free(pBlock);
+}
+#else
+extern "C" {
+void* __libc_malloc(size_t nSize);
+void* __libc_calloc(size_t nItems, size_t nSize);
+
+void* malloc(size_t nSize) {
+    return AllocationFails() ? nullptr : __libc_malloc(nSize);
+}
+void* calloc(size_t nItems, size_t nSize) {
+    return AllocationFails() ? nullptr : __libc_calloc(nItems, nSize);
+}
+}
+#endif
 
 extern "C" {
 
 void syslog(int /*nPriority*/, const char* szFormat, ...) {
+    const OwnMemory own;
     char szLine[8192];
     va_list args;
     va_start(args, szFormat);
@@ -52,6 +104,14 @@ unsigned sleep(unsigned nSeconds) {
     }
     gNSlept += static_cast<int>(nSeconds);
     return 0;
+}
+
+int clock_gettime(clockid_t nClock, timespec* pTime) {
+    static const auto fnReal = reinterpret_cast<int (*)(clockid_t, timespec*)>(dlsym(RTLD_NEXT, "clock_gettime"));
+    static time_t nAhead = 0;
+    const int nResult = fnReal(nClock, pTime);
+    pTime->tv_sec += nAhead += gNClockStep;
+    return nResult;
 }
 
 int TAVONetDefaultGatewayGet(char* szGateway, int nSize) {

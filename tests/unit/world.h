@@ -21,6 +21,24 @@ extern std::function<void()> gFnOnSleep;
 // Answers in place of the platform's write of router.conf, when set.
 extern std::function<int()> gFnOnConfSet;
 
+// Seconds that the clock jumps ahead each time somebody looks at it.
+extern int gNClockStep;
+
+// Memory runs out after so many allocations (never: negative), for one of them or for good.
+extern long gNGoodAllocations;
+extern bool gBlOneFailure;
+extern bool gBlAllocationFailed;
+// While one of these lives, what is allocated is the test's own and always there.
+class OwnMemory {
+public:
+    OwnMemory() { ++nDepth; }
+    ~OwnMemory() { --nDepth; }
+    OwnMemory(const OwnMemory&) = delete;
+    OwnMemory& operator=(const OwnMemory&) = delete;
+
+    static int nDepth;
+};
+
 inline void Write(const std::string& szPath, const std::string& szText) {
     std::filesystem::create_directories(std::filesystem::path(szPath).parent_path());
     std::ofstream(szPath) << szText;

@@ -278,11 +278,11 @@ int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppH
             }
             std::optional<std::string> szValue;
             if (nSeparator != std::string_view::npos) {
-                // What stands behind the separator reads like any other value of a key file.
-                const std::string szPair = "k=" + std::string(szLine.substr(nSeparator + std::strlen(szSeparator)));
-                if (const auto pair = tavo::ParseKeyLine(szPair)) {
-                    szValue = pair->szValue;
-                }
+                // What stands behind the separator reads like any other value of a key file; what cannot be
+                // read so stands as it is, for nobody to take it for missing.
+                const std::string_view szRest = szLine.substr(nSeparator + std::strlen(szSeparator));
+                const auto pair = tavo::ParseKeyLine("k=" + std::string(szRest));
+                szValue = pair ? pair->szValue : std::string(tavo::Trim(szRest));
             }
             if (TLIBCSzHashSetValue(*ppHash, szKey.c_str(), szValue ? szValue->c_str() : nullptr) < 0) {
                 return -1;

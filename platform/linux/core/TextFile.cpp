@@ -10,6 +10,7 @@
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
+#include <memory>
 
 #include "core/Descriptor.h"
 #include "tavo/core.h"
@@ -203,10 +204,8 @@ std::string Resolve(const std::string& szPath) {
     if (stat(szDir.empty() ? "." : szDir.c_str(), &status) == 0 && (status.st_mode & S_ISVTX) != 0) {
         return szPath;
     }
-    char* szReal = realpath(szPath.c_str(), nullptr);
-    std::string szTarget = szReal == nullptr ? szPath : szReal;
-    std::free(szReal);
-    return szTarget;
+    const std::unique_ptr<char, decltype(&std::free)> szReal(realpath(szPath.c_str(), nullptr), &std::free);
+    return szReal ? szReal.get() : szPath;
 }
 
 // The new name must survive a power cut as well.

@@ -1,7 +1,6 @@
 // The router description database: model names, descriptions with their operations, and the refresh.
 // Relies on sectioned files below the database's directory, on wget and tar for the refresh.
 // Promises: no name leads outside the directory; a refresh that fails leaves the old database.
-#include <dirent.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "core/Border.h"
+#include "core/Directory.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterScript.h"
@@ -38,14 +38,15 @@ int Fail(int nErr, int nLine) {
     return -1;
 }
 
-std::vector<std::string> Directories(const fs::path& dir) {
-    std::vector<std::string> rgszNames;
+bool IsDirectory(const fs::path& path) {
     std::error_code error;
-    for (fs::directory_iterator it(dir, error), end; !error && it != end; it.increment(error)) {
-        if (it->is_directory(error)) {
-            rgszNames.push_back(it->path().filename());
-        }
-    }
+    return fs::is_directory(path, error);
+}
+
+// Throws when the directory cannot be read: a list is whole or absent.
+std::vector<std::string> Directories(const fs::path& dir) {
+    std::vector<std::string> rgszNames = tavo::NamesIn(dir).value();
+    std::erase_if(rgszNames, [&dir](const std::string& szName) { return !IsDirectory(dir / szName); });
     std::sort(rgszNames.begin(), rgszNames.end());
     return rgszNames;
 }
@@ -59,12 +60,15 @@ bool IsFile(const fs::path& path) {
 std::string GenericVersion(const fs::path& model) {
     char szVersion[kVersionSize] = {};
     const fs::path generic = model / "generic";
-    return TLIBCFileGetKeyValue(generic.c_str(), "version", szVersion, sizeof(szVersion), 0) >= 1 ? szVersion : "";
+    if (TLIBCFileGetKeyValue(generic.c_str(), "version", szVersion, sizeof(szVersion), 0) >= 1) {
+        return szVersion;
+    }
+    return TLIBCErrGet() == TLIBC_ERR_NO_MEMORY ? throw std::bad_alloc() : "";
 }
 
 void Push(TLIBCSzList* pList, const std::string& szName) {
     if (TLIBCSzListPush(pList, szName.c_str()) < 0) {
-        throw std::bad_alloc();  // a list is whole or absent
+        throw std::bad_alloc();
     }
 }
 
@@ -173,8 +177,7 @@ int RouterDBList(TLIBCSzList** ppList) {
         if (ppList == nullptr) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        std::error_code error;
-        if (!fs::is_directory(kDatabase, error)) {
+        if (!IsDirectory(kDatabase)) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
         std::unique_ptr<TLIBCSzList, decltype(&TLIBCSzListFree)> pList(TLIBCSzListAlloc(0), &TLIBCSzListFree);

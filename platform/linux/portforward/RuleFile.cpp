@@ -12,6 +12,7 @@
 #include <new>
 
 #include "core/Border.h"
+#include "core/Directory.h"
 #include "portforward/ConfList.h"
 #include "portforward/PortText.h"
 
@@ -40,11 +41,12 @@ void RecoverAside(const char* szPath) {
     const std::string szName = path.filename();
     std::error_code error;
     fs::path newest;
-    for (fs::directory_iterator it(path.parent_path(), error), end; !error && it != end; it.increment(error)) {
-        const std::string szSeen = it->path().filename();
+    const auto rgszSeen = tavo::NamesIn(path.parent_path());
+    for (const std::string& szSeen : rgszSeen ? *rgszSeen : std::vector<std::string>()) {
         const bool blCopy = szSeen.size() == szName.size() + kAsideSuffix && szSeen.starts_with(szName);
-        if (blCopy && (newest.empty() || fs::last_write_time(newest, error) < it->last_write_time(error))) {
-            newest = it->path();
+        const fs::path copy = path.parent_path() / szSeen;
+        if (blCopy && (newest.empty() || fs::last_write_time(newest, error) < fs::last_write_time(copy, error))) {
+            newest = copy;
         }
     }
     if (!newest.empty() && renameat2(AT_FDCWD, newest.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {

@@ -1,0 +1,554 @@
+// Saving rules on a played stage: the order of every step, each step failing in turn, what the router
+// refused, memory that runs out anywhere; and the tools that the library runs, well behaved and not.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "libtavoportmap.h"
+#include "stage.h"
+#include "tavo/portforward.h"
+#include "world.h"
+
+namespace {
+
+constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+constexpr char kOldRules[] = "[9]\nenabled=\"1\"\n";
+constexpr char kMarker[] = "/tmp/pfProgress";
+constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+constexpr char kToolRun[] = "> run /usr/tavo/bin/tavoportforward >/dev/null 2>&1";
+constexpr char kWrite[] = "> write /etc/portforward/rule.conf";
+constexpr char kNatpmpOff[] = "> runnatpmpportmapping=no";
+constexpr char kUpnpOff[] = "> runupnpportmapping=no";
+constexpr char kNatpmpOn[] = "> runnatpmpportmapping=yes";
+constexpr char kUpnpOn[] = "> runupnpportmapping=yes";
+constexpr int kNeverDone = 0;
+using Rule = __tag_TAVO_ROUTER_RULE;
+using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
+using Story = std::vector<std::string>;
+
+class Saving : public testing::Test {
+protected:
+    void SetUp() override {
+        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"}) {
+            std::filesystem::remove_all(szDir);
+            std::filesystem::create_directories(szDir);
+        }
+        Write("/etc/portforward/router_upnp.db", "[B/M/1]\nmax=2\n[brand longer than a small string/M/1]\nmax=2\n");
+        Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", "[PF port page]\nmax rule=10\n");
+        Reset();
+    }
+    void TearDown() override {
+        gFnOnSleep = nullptr;
+        gStage = Stage();
+        std::filesystem::remove(kMarker);
+    }
+    // A fresh stage on which whoever applies the rules is done after so many sleeps.
+    void Reset(int nBusySleeps = 1) {
+        for (const char* szFile : {"/etc/tavoinfo.conf", "/var/run/upnpd.pid", "/var/run/natpmpd.pid", kMarker,
+                                   "/var/tmp/upnp_portmap.status", "/var/tmp/natpmp_portmap.remap"}) {
+            std::filesystem::remove(szFile);
+        }
+        Write(kRuleConf, kOldRules);
+        gStage = Stage();
+        gStage.blOn = true;
+        gStage.fnRun = [](const std::string&) { gStage.alive.insert("tavoportforward"); };
+        gFnOnSleep = [nBusySleeps, nSleep = 0]() mutable {
+            if (++nSleep == nBusySleeps) {
+                unlink(kMarker);
+                gStage.alive.erase("tavoportforward");
+            }
+        };
+        gSzGateway = "192.168.1.1";
+        gNSlept = 0;
+        gLog.clear();
+    }
+    static void Router(const std::string& szNatpmp, const std::string& szUpnp, const std::string& szBrand = "B") {
+        Write("/etc/portforward/router.conf", "[192.168.1.1]\nbrand=" + szBrand + "\nmodel=M\nversion=1\n" +
+                                                  "support_router_natpmp=" + szNatpmp +
+                                                  "\nsupport_router_upnp=" + szUpnp + "\n");
+    }
+    static void Router(const std::string& szWay) {
+        Router(szWay == "natpmp" ? "yes" : "no", szWay == "upnp" ? "yes" : "no");
+        if (szWay.empty()) {
+            std::filesystem::remove("/etc/portforward/router.conf");
+        }
+    }
+    int Save(int nRules = 1) {
+        mResult = {};
+        const auto fnNote = [](const SaveResult* pResult, void*) {
+            const OwnMemory own;
+            Tell(std::to_string(pResult->nProgress));
+        };
+        return TLibSaveRules("192.168.1.1", nRules, nRules == 0 ? nullptr : mRgRules, true, &mResult, fnNote, nullptr);
+    }
+    static bool LockIsFree() {
+        const bool blFree = TLibTavoPortMapLock() == 0;
+        TLibTavoPortMapUnLock();
+        return blFree;
+    }
+    static bool EndsWith(const Story& end) {
+        return gLog.size() >= end.size() && std::equal(end.rbegin(), end.rend(), gLog.rbegin());
+    }
+
+    SaveResult mResult = {};
+    Rule mRgRules[3] = {{"1", true, "tcp", "80", "8080", "web", "Web", {}},
+                        {"2", true, "udp", "", "", "", "", {}},
+                        {"3", true, "tcp", "81", "81", "", "", {}}};
+};
+
+TEST_F(Saving, TakesEveryStepInItsOrder) {
+    const Story begin = {"> 20", "> 40", kNatpmpOff, kUpnpOff, "> 60", kWrite, "> 80"};
+    const Story end = {"> 100", "> ask tavorelayd", "> reload tavorelayd"};
+    const struct {
+        const char* szNatpmp;
+        const char* szUpnp;
+        std::set<std::string> alive;
+        const char* szPid;
+        int nRules;
+        Story story;
+        int nSlept;
+    } rgFlows[] = {
+        {"yes",
+         "yes",
+         {"upnpd"},
+         "",
+         2,
+         {kNatpmpOn, "> signal upnpd 1", "> exec /usr/tavo/sbin/natpmpd", "natpmp daemon is alive now", "> 90",
+          "> remap", "natpmpd checking is done"},
+         3},
+        {"no",
+         "yes",
+         {"upnpd", "natpmpd"},
+         "4711",
+         1,
+         {kUpnpOn, "> signal natpmpd 1", "> kill 4711 1", "upnp daemon is alive now", "> 90", "upnpd checking is done"},
+         3},
+        {"no",
+         "yes",
+         {"upnpd"},
+         "junk",
+         1,
+         {kUpnpOn, "> signal upnpd 1", "> exec /usr/tavo/sbin/upnpd", "upnp daemon is alive now", "> 90",
+          "upnpd checking is done"},
+         3},
+        {"no", "yes", {}, "", 0, {kUpnpOn, "> exec /usr/tavo/sbin/upnpd"}, 0},
+        {"yes", "no", {}, "", 0, {kNatpmpOn, "> exec /usr/tavo/sbin/natpmpd"}, 0},
+        {"Yes", "YES", {}, "", 1, {kToolRun}, 3},
+        {"no", "unknown", {}, "", 0, {kToolRun}, 3},
+    };
+    for (const auto& flow : rgFlows) {
+        Reset(3);
+        Router(flow.szNatpmp, flow.szUpnp);
+        Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
+        Write("/var/tmp/natpmp_portmap.remap", "");
+        Write("/var/run/upnpd.pid", flow.szPid);
+        gStage.alive = flow.alive;
+        mResult.nStatus = 77;
+        EXPECT_EQ(Save(flow.nRules), 0);
+        Story story = begin;
+        story.insert(story.end(), flow.story.begin(), flow.story.end());
+        story.insert(story.end(), end.begin(), end.end());
+        EXPECT_EQ(gLog, story);
+        EXPECT_EQ(gNSlept, flow.nSlept);
+        EXPECT_EQ(mResult.nStatus, 0);
+        EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), flow.nRules == 0 ? 0 : 1);
+    }
+    Reset();
+    gStage.blRelay = false;
+    EXPECT_EQ(Save(), 0);
+    EXPECT_EQ(gLog.back(), "> ask tavorelayd");
+}
+
+TEST_F(Saving, EndsAtTheStepThatFails) {
+    const Story checkFails = {"get max rule fail", "check exceed max rule fail"};
+    const Story countFails = {"TLIBPFCountRuleConf fail", "get setting rules fail", "check exceed max rule fail"};
+    const struct {
+        const char* szWay;
+        const char* szFail;
+        int nWorks;
+        Story end;
+        bool blWritten;
+        int nSlept;
+    } rgFailures[] = {
+        {"upnp", "hash", 1, {"> 40", "hash malloc failed", "add rule failed"}, false, 0},
+        {"upnp", "service", 0, {"> 40", "set service name=Web", "add rule failed"}, false, 0},
+        {"", "", 0, {"> 40", "can not get support upnp"}, false, 0},
+        {"upnp", "run key", 0, {"> 40", kNatpmpOff, "Failed to Set run key [/etc/tavoinfo.conf]"}, false, 0},
+        {"upnp", "run key", 1, {"> 40", kNatpmpOff, kUpnpOff, "Failed to Set run key [/etc/tavoinfo.conf]"}, false, 0},
+        {"natpmp", "look-up", 0, checkFails, false, 0},
+        {"upnp", "look-up", 0, checkFails, false, 0},
+        {"natpmp", "count", 0, countFails, false, 0},
+        {"natpmp", "write", 0, {"> 60", kWrite, "save config failed", "sync rule to file fail"}, false, 0},
+        {"upnp", "write", 0, {"> 60", kWrite, "save config failed", "can not sync rules to file"}, false, 0},
+        {"natpmp", "run key", 2, {"> 80", kNatpmpOn, "Failed to Set natpmp run key!"}, true, 0},
+        {"upnp", "run key", 2, {"> 80", kUpnpOn, "Failed to Set upnp run key!"}, true, 0},
+        {"natpmp",
+         "exec",
+         0,
+         {"> exec /usr/tavo/sbin/natpmpd", "exec natpmpd daemon failed", "StartDaemon() natpmpd failed",
+          "upnp daemon start failed"},
+         true,
+         0},
+        {"upnp",
+         "exec",
+         0,
+         {"> exec /usr/tavo/sbin/upnpd", "exec upnpd daemon failed", "StartDaemon() upnpd failed",
+          "upnp daemon start failed"},
+         true,
+         0},
+        {"natpmp", "remap", 0, {"> remap", "> remap", "check natpmp daemon failed"}, true, 22},
+        {"upnp",
+         "status",
+         0,
+         {"> 90", "failed to read key-value pairs from /var/tmp/upnp_portmap.status", "check daemon failed"},
+         true,
+         23},
+        {"upnp", "hash", 2, {"> 90", "failed to allocate list", "check daemon failed"}, true, 1},
+        {"manual",
+         "description",
+         0,
+         {"> 60", "get desc and script failed", "can not get router desc", "can not get max ports"},
+         false,
+         0},
+        {"manual", "PF add port", 0, {"> 60", "failed to count port job of rules"}, false, 0},
+        {"manual", "PF add range", 0, {"> 60", "failed to count range job of rules"}, false, 0},
+        {"manual", "write", 0, {"> 60", kWrite, "save config failed", "can not sync rules to file"}, false, 0},
+        {"manual",
+         "run",
+         0,
+         {"> 80", kToolRun, "execute tavoportforward failed", "tavoportforward start failed"},
+         true,
+         0},
+    };
+    for (const auto& failure : rgFailures) {
+        SetUp();
+        Router(failure.szWay);
+        if (std::string(failure.szFail) == "description") {
+            std::filesystem::remove_all("/etc.defaults/portforward/routerdb");
+        }
+        Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
+        gStage.szFail = failure.szFail;
+        gStage.nWorks = failure.nWorks;
+        EXPECT_EQ(Save(), -1) << failure.szWay << " " << failure.szFail;
+        EXPECT_TRUE(EndsWith(failure.end)) << failure.szWay << " " << failure.szFail << "\n"
+                                           << testing::PrintToString(gLog);
+        EXPECT_EQ(mResult.nStatus, 0);
+        EXPECT_EQ(gNSlept, failure.nSlept) << failure.szWay << " " << failure.szFail;
+        EXPECT_EQ(std::count(gLog.begin(), gLog.end(), "> remap"), std::string(failure.szFail) == "remap" ? 22 : 0);
+        EXPECT_EQ(Read(kRuleConf) != kOldRules, failure.blWritten) << failure.szWay << " " << failure.szFail;
+        EXPECT_TRUE(LockIsFree());
+    }
+}
+
+TEST_F(Saving, WaitsFiveMinutesAndNoLonger) {
+    const struct {
+        const char* szWay;
+        bool blStillborn;
+        const char* szLine;
+    } rgWaits[] = {{"natpmp", false, "wait natpmp daemon alive time out"},
+                   {"natpmp", true, "wait natpmp daemon alive time out"},
+                   {"upnp", false, "wait upnp daemon alive time out"},
+                   {"upnp", true, "wait upnp daemon alive time out"},
+                   {"manual", false, "wait manual pf process finish time out"}};
+    for (const auto& wait : rgWaits) {
+        Reset(wait.blStillborn ? 1 : kNeverDone);
+        Router(wait.szWay);
+        gStage.blStillborn = wait.blStillborn;
+        EXPECT_EQ(Save(), -1);
+        EXPECT_EQ(gLog.back(), wait.szLine);
+        EXPECT_EQ(gNSlept, 302);
+    }
+}
+
+TEST_F(Saving, FailsInADaemonThatRunsWithTheWordsOfTheWayItTook) {
+    const struct {
+        const char* szPid;
+        const char* szFail;
+        Story end;
+    } rgFailures[] = {
+        {"4711", "kill", {"send SIGHUP to upnpd failed errno=No such process", "HupDaemon() upnpd failed"}},
+        {"", "exec", {"exec upnpd daemon failed", "StartDaemon() failed", "RestartDaemon() upnpd failed"}}};
+    Router("upnp");
+    for (const auto& failure : rgFailures) {
+        Reset();
+        Write("/var/run/upnpd.pid", failure.szPid);
+        Write(kMarker, "");
+        gStage.alive = {"upnpd"};
+        gStage.szFail = failure.szFail;
+        EXPECT_EQ(Save(), -1);
+        Story end = failure.end;
+        end.emplace_back("upnp daemon start failed");
+        EXPECT_TRUE(EndsWith(end)) << testing::PrintToString(gLog);
+        EXPECT_FALSE(std::filesystem::exists(kMarker));
+    }
+}
+
+TEST_F(Saving, ReportsWhatTheRouterRefused) {
+    const std::string szLong(3000, 'p');
+    const struct {
+        const char* szWay;
+        int nRules;
+        std::string szAnswer;
+        int nStatus;
+        std::string szPorts;
+        Story end;
+    } rgAnswers[] = {
+        {"upnp", 3, "", 7, std::string(1, '\x02'), {"> 60", "exceed max rule"}},
+        {"natpmp", 3, "", 7, std::string(1, '\x02'), {"> 60", "exceed max rule"}},
+        {"upnp",
+         1,
+         "a=1\nb=718\nc=501\nd=718\n",
+         8,
+         "b, d",
+         {"upnpd checking is done", "> event 1 2 13100022 b, d|||", "upnp port conflict"}},
+        {"upnp",
+         1,
+         "a=1\nc=501\n",
+         9,
+         "c",
+         {"upnpd checking is done", "> event 1 3 13100020 c|||", "upnp add port fail"}},
+        {"upnp",
+         1,
+         "# x=718\n\n=718\nno value\na=1\r\n b = \"1\" \nc=\nd=1x\ne=\"718\nf=1=2\n",
+         9,
+         "c, d, e, f",
+         {"> event 1 3 13100020 c, d, e, f|||", "upnp add port fail"}},
+        {"upnp",
+         1,
+         szLong + "=718\n",
+         8,
+         szLong.substr(0, 1023),
+         {"> event 1 2 13100022 " + szLong + "|||", "upnp port conflict"}},
+        {"natpmp", 1, "80 -> 81", 8, "80 -> 81", {"natpmpd checking is done", "natpmp port conflict"}},
+        {"natpmp", 1, szLong, 8, szLong.substr(0, 1023), {"natpmpd checking is done", "natpmp port conflict"}},
+    };
+    for (const auto& answer : rgAnswers) {
+        Reset();
+        Router(answer.szWay);
+        Write("/var/tmp/upnp_portmap.status", answer.szAnswer);
+        Write("/var/tmp/natpmp_portmap.remap", answer.szAnswer);
+        EXPECT_EQ(Save(answer.nRules), -1);
+        EXPECT_EQ(mResult.nStatus, answer.nStatus);
+        EXPECT_EQ(std::string(mResult.szPortList), answer.szPorts);
+        EXPECT_TRUE(EndsWith(answer.end)) << testing::PrintToString(gLog);
+    }
+    bool blRemap = false;
+    std::string szRemap;
+    EXPECT_TRUE(NatpmpDaemon().CheckDaemon(blRemap, szRemap));
+    EXPECT_EQ(szRemap, szLong);
+}
+
+// Calls fnCall with the n-th allocation failing, for every n, alone and with all that follow.
+template <typename Call>
+void RunOutOfMemory(Call fnCall) {
+    for (const bool blOne : {true, false}) {
+        bool blFailed = true;
+        for (long n = 0; blFailed; ++n) {
+            gBlOneFailure = blOne;
+            gBlAllocationFailed = false;
+            fnCall([n] { gNGoodAllocations = n; });
+            gNGoodAllocations = -1;
+            blFailed = gBlAllocationFailed;
+            ASSERT_LT(n, 20000);
+        }
+    }
+}
+
+TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
+    std::set<std::string> said;
+    std::string szNewRules;
+    for (const char* szWay : {"manual", "natpmp", "upnp"}) {
+        RunOutOfMemory([&](const auto& fnArm) {
+            Reset();
+            const bool blManual = std::string(szWay) == "manual";
+            Router(szWay[0] == 'n' ? "yes" : "no", szWay[0] == 'u' ? "yes" : "no",
+                   blManual ? "B" : "brand longer than a small string");
+            Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
+            Write("/var/tmp/natpmp_portmap.remap", "");
+            fnArm();
+            const int nResult = Save();
+            gNGoodAllocations = -1;
+            szNewRules = nResult == 0 ? Read(kRuleConf) : szNewRules;
+            EXPECT_NE(szNewRules, kOldRules);
+            EXPECT_TRUE(Read(kRuleConf) == kOldRules || Read(kRuleConf).find("[1]\n") == 0) << Read(kRuleConf);
+            EXPECT_TRUE(LockIsFree());
+            said.insert(gLog.begin(), gLog.end());
+        });
+    }
+    for (const char* szLine : {"fail to get brand", "get max rule fail", "add rule failed", "can not get max ports",
+                               "sync rule to file fail", "failed to allocate list"}) {
+        EXPECT_TRUE(said.contains(szLine)) << szLine;
+    }
+}
+
+void MakeTool(const std::string& szScript) {
+    Write(kTool, "#!/bin/sh\n" + szScript);
+    chmod(kTool, 0755);
+}
+
+TEST_F(Saving, KnowledgeBaseSurvivesMemoryThatRunsOut) {
+    Write("/etc.defaults/portforward/routerdb/B/M/generic", "version=\"1\"\n");
+    MakeTool("echo syntax version=3\n");
+    Router("manual");
+    RunOutOfMemory([&](const auto& fnArm) {
+        __tag_TAVO_ROUTERDB_LIST* pList = nullptr;
+        gStage.blOn = false;
+        fnArm();
+        TLibGetRouterDBList(&pList);
+        gNGoodAllocations = -1;
+        if (pList != nullptr) {
+            EXPECT_NE(pList->pNext, nullptr);  // whole or absent
+            TLibFreeRouterDBList(pList);
+        }
+        int nMax = 0;
+        std::string szPfpath;
+        fnArm();
+        RouterDB("192.168.1.1").GetMaxPorts(nMax);
+        RouterUpnpDB("B", "M", "1").GetPfpath(szPfpath);
+    });
+    gStage.blOn = true;
+    RunOutOfMemory([](const auto& fnArm) {
+        int nVersion = 0;
+        fnArm();
+        RouterUpnpDB::Update(nVersion);
+    });
+}
+
+TEST_F(Saving, ReadsTheVersionOfTheTool) {
+    gStage.blOn = false;
+    const struct {
+        const char* szOutput;
+        int nVersion;
+    } rgOutputs[] = {{"x\\nsyntax version = 3\\nsyntax version=4\\n", 4},
+                     {"syntax version = 5", 5},
+                     {"syntax versions of rules: = 6 \\n", 6},
+                     {" syntax version=1\\nSyntax version=2\\nsyntax version 3\\n", -1},
+                     {"syntax version=99999999999999999999\\n", INT32_MAX},
+                     {"syntax version=junk\\n", 0},
+                     {"", -1}};
+    for (const auto& output : rgOutputs) {
+        MakeTool("printf '" + std::string(output.szOutput) + "'\nexit 3\n");
+        EXPECT_EQ(IGetCurrSyntaxVersion(), output.nVersion) << output.szOutput;
+    }
+    MakeTool("/usr/bin/head -c 200000 /dev/zero | /usr/bin/tr '\\0' x; printf '\\nsyntax version=7\\n'\n");
+    EXPECT_EQ(IGetCurrSyntaxVersion(), 7);
+    std::filesystem::remove(kTool);
+    EXPECT_EQ(IGetCurrSyntaxVersion(), -1);
+}
+
+TEST_F(Saving, GivesUpAToolThatHangs) {
+    gStage.blOn = false;
+    for (const char* szScript : {"while :; do /bin/sleep 1; done\n", "exec >&-\nwhile :; do /bin/sleep 1; done\n",
+                                 "while :; do echo x; done\n"}) {
+        MakeTool(szScript);
+        gNClockStep = 1;
+        EXPECT_EQ(IGetCurrSyntaxVersion(), -1);
+        gNClockStep = 0;
+        for (int i = 0; i < 500 && TLIBCIsProcAlive("tavoportforward") == 1; ++i) {
+            usleep(10000);
+        }
+        EXPECT_EQ(TLIBCIsProcAlive("tavoportforward"), 0) << szScript;
+    }
+}
+
+TEST_F(Saving, NoToolThatStaysAliveKeepsTheLock) {
+    gStage.blOn = false;
+    MakeTool("/bin/sleep 20 &\necho syntax version=3\n");
+    // A process that dies with the lock leaves it to nobody: neither to the tool's child nor to its own.
+    const pid_t pid = fork();
+    if (pid == 0) {
+        const bool blGood = TLibTavoPortMapLock() == 0 && IGetCurrSyntaxVersion() == 3 &&
+                            TLIBCExec("/bin/sleep", "20", nullptr, nullptr, nullptr) == 0 &&
+                            TLIBCSystem("/bin/sleep 20 &") == 0 && std::system("/bin/sleep 20 &") == 0;
+        _exit(blGood ? 0 : 1);
+    }
+    int nStatus = -1;
+    waitpid(pid, &nStatus, 0);
+    EXPECT_EQ(nStatus, 0);
+    EXPECT_TRUE(LockIsFree());
+    EXPECT_EQ(TLIBCKill("/bin/sleep 20", SIGKILL), 4);
+}
+
+TEST_F(Saving, RefreshesTheDatabaseOfItsOwnVersionOnly) {
+    const std::string szFetch = "> run /usr/tavo/bin/wget 'http://h/d/";
+    const std::string szTo = "' -O /etc/portforward/";
+    const std::string szVersion = szFetch + "routersdk_version" + szTo + "routersdk_version >/dev/null 2>&1";
+    const std::string szDb = szFetch + "router_upnp.db" + szTo + "router_upnp.db >/dev/null 2>&1";
+    MakeTool("echo syntax version = 3\n");
+    const struct {
+        const char* szServed;  // the version file as it comes
+        const char* szFail;
+        int nWorks;
+        bool blUpdated;
+        int nVersion;
+        Story story;
+    } rgUpdates[] = {
+        {"version=3\n", "", 0, true, 3, {szVersion, szDb}},
+        {"version=\"4\"\n", "", 0, true, 4, {szVersion}},
+        {"version=junk\n", "", 0, true, 0, {szVersion}},
+        {"version=12345678901\n", "", 0, true, 1234567, {szVersion}},
+        {"\x01[x]\n", "", 0, false, -5, {szVersion, "can not read router sdk version"}},
+        {"", "run", 0, false, -5, {szVersion, "update upnp router info failed"}},
+        {"version=3\n", "run", 1, false, -5, {szVersion, szDb, "update upnp router info failed"}},
+    };
+    for (const auto& update : rgUpdates) {
+        Reset();
+        gStage.fnRun = [&](const std::string&) { Write("/etc/portforward/routersdk_version", update.szServed); };
+        gStage.szFail = update.szFail;
+        gStage.nWorks = update.nWorks;
+        int nVersion = -5;
+        EXPECT_EQ(RouterUpnpDB::Update(nVersion), update.blUpdated) << update.szServed;
+        EXPECT_EQ(nVersion, update.nVersion);
+        EXPECT_EQ(gLog, update.story);
+    }
+}
+
+TEST_F(Saving, NoDownloadLocationLeavesItsQuotes) {
+    int nVersion = 0;
+    gStage.szLocation = "http://h/a'; touch /tmp/trap; '";
+    RouterUpnpDB::Update(nVersion);
+    EXPECT_EQ(gLog[0],
+              "> run /usr/tavo/bin/wget 'http://h/a'\\''; touch /tmp/trap; '\\''/routersdk_version' -O "
+              "/etc/portforward/routersdk_version >/dev/null 2>&1");
+    gLog.clear();
+    gStage.szLocation = std::string(4090, 'x');
+    EXPECT_FALSE(RouterUpnpDB::Update(nVersion));
+    EXPECT_EQ(gLog, Story{"update upnp router info failed"});
+    gStage.blOn = false;
+    const std::string szEndless(2000, 'x');
+    for (const char* szSetting :
+         {"http://h/'x", "http://h/\\nx", "-O/etc/passwd", "http://h/\\\\x", szEndless.c_str()}) {
+        Write("/etc/tavo/platform.conf", "[download]\ndatabase_url=\"" + std::string(szSetting) + "\"\n");
+        EXPECT_STREQ(GetRouterDBPath(), "") << szSetting;
+    }
+    std::filesystem::remove("/etc/tavo/platform.conf");
+}
+
+TEST_F(Saving, ReadsAnyDescriptionAndNoNameOutsideTheDatabase) {
+    std::string szPages = "[global]\nsyntax version=2\n[pf port page]\nmax rule=1\n";
+    for (int i = 0; i < 5000; ++i) {
+        szPages += "[PF port page]\nmax rule=" + std::to_string(i) +
+                   "\nchange router port=YES\nsupport range=Multi\n[PF range page]\n[other]\nudp=1\n";
+    }
+    Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", szPages);
+    Router("manual");
+    RouterDB db("192.168.1.1");
+    int nPorts = 0, nRange = -1, nSyntax = 0;
+    bool blPageRange = false, blChangePort = false;
+    EXPECT_TRUE(db.GetMaxPorts(nPorts) && db.GetMaxRange(nRange) && db.GetSyntaxVersion(nSyntax));
+    EXPECT_TRUE(db.IsSupportPageRange(blPageRange) && db.IsSupportChangePort(blChangePort));
+    EXPECT_EQ(nPorts, 4999);
+    EXPECT_EQ(nRange, 0);
+    EXPECT_EQ(nSyntax, 2);
+    EXPECT_TRUE(blPageRange && blChangePort);
+    Write("/etc.defaults/portforward/generic", "version=\"5\"\n");
+    Write("/etc.defaults/portforward/routerdb/B/generic", "version=\"5\"\n");
+    for (std::string szName : {"..: routerdb/..", "B: .", "B: ..", "B: M/..", ": M", "B: "}) {
+        std::string szBrand = "kept", szModel, szVersion;
+        EXPECT_FALSE(SplitRouterName(szName.data(), szBrand, szModel, szVersion)) << szName;
+        EXPECT_EQ(szBrand, "kept");
+    }
+}
+
+}  // namespace
