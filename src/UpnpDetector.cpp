@@ -23,13 +23,8 @@ constexpr char kPfPath[] = "upnp_pfpath";
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
 
-// One step down, and never up or sideways: the name comes from a database, the path must not leave it.
-bool IsPathPart(const std::string& szPart) {
-    return !szPart.empty() && szPart != "." && szPart != ".." && szPart.find('/') == std::string::npos;
-}
-
 bool HasDescription(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
-    if (!IsPathPart(szBrand) || !IsPathPart(szModel) || !IsPathPart(szVersion)) {
+    if (!tavo::lib::IsPathPart(szBrand) || !tavo::lib::IsPathPart(szModel) || !tavo::lib::IsPathPart(szVersion)) {
         return false;
     }
     const std::string szPath =
