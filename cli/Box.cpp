@@ -1,0 +1,83 @@
+// Questions and complaints that several commands share. Relies on the library's public header.
+// Promises: see Box.h.
+#include "Box.h"
+
+#include <fmt/format.h>
+#include <unistd.h>
+
+namespace tavo::cli {
+
+std::optional<std::string> Gateway() {
+    std::string szGateway;
+    return GetGatewayIP(szGateway) != 0 ? std::optional(szGateway) : std::nullopt;
+}
+
+Reply NoGateway() {
+    return {.enExit = kFailed,
+            .szMessage =
+                "this box has no default gateway, so there is no router to talk to; 'ip route' shows the "
+                "routes"};
+}
+
+Reply Busy() {
+    std::string szMessage = "another port-forwarding operation is running; try again when it has ended";
+    if (geteuid() != 0) {
+        szMessage += "\n(or this user may not take the lock /tmp/routerconf.lock: try it with sudo)";
+    }
+    return {.enExit = kBusy, .szMessage = szMessage};
+}
+
+Reply Failure(const std::string& szMessage) {
+    return {.enExit = kFailed,
+            .szMessage = szMessage + (geteuid() != 0 ? "\n(this needs root: try it with sudo)" : "")};
+}
+
+Way WayOf(const std::string& szUpnp, const std::string& szNatpmp) {
+    if (szNatpmp == "yes") {
+        return Way::kNatpmp;
+    }
+    if (szUpnp == "yes") {
+        return Way::kUpnp;
+    }
+    return szUpnp == "no" && szNatpmp == "no" ? Way::kManual : Way::kUnknown;
+}
+
+std::string ToWords(Way enWay) {
+    switch (enWay) {
+        case Way::kNatpmp:
+            return "NAT-PMP";
+        case Way::kUpnp:
+            return "UPnP";
+        case Way::kManual:
+            return "manual (through its own administration pages)";
+        default:
+            return "unknown";
+    }
+}
+
+std::string RouterName(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
+    std::string szName = Clean(szBrand);
+    szName += (szName.empty() || szModel.empty() ? "" : " ") + Clean(szModel);
+    szName += szVersion.empty() ? "" : fmt::format("{}({})", szName.empty() ? "" : " ", Clean(szVersion));
+    return szName;
+}
+
+std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, int nMaxRules) {
+    const std::string szBrand = conf.szBrand;
+    // The database has one record for all models of these two makers.
+    const bool blWholeBrand = szBrand == "Tavo Inc." || szBrand == "AirPort";
+    RouterUpnpDBUserWriter writer(blWholeBrand ? szBrand + "//" : szBrand + "/" + conf.szModel + "/" + conf.szVersion);
+    if (!writer.Init() || !writer.SetSupport("yes") || !writer.SetMaxRule(nMaxRules) || !writer.Sync()) {
+        return "the number of rules could not be recorded in /etc/portforward/router_upnp.db.user";
+    }
+    int nKnown = -1;
+    if (!RouterUpnpDB(szBrand, conf.szModel, conf.szVersion).GetMaxRule(nKnown) || nKnown != nMaxRules) {
+        return fmt::format(
+            "the downloaded database says that this router holds {} rules; its word comes before "
+            "--max-rules",
+            nKnown);
+    }
+    return std::nullopt;
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,143 @@
+// Reads and writes the stored rules and compares their ports. Relies on the library's public header.
+// Promises: see RuleStore.h.
+#include "RuleStore.h"
+
+#include <CLI/StringTools.hpp>
+#include <algorithm>
+#include <array>
+#include <charconv>
+#include <set>
+
+#include "Box.h"
+
+namespace tavo::cli {
+
+namespace {
+
+constexpr int kPorts = 65536;
+
+// How many rules the library itself can make out; negative when it cannot read the file.
+int CountReadable() {
+    int nRules = 0;
+    __tag_TAVO_ROUTER_RULE* pRules = nullptr;
+    if (TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr) != 0) {
+        return -1;
+    }
+    TLibFreeRulesArr(pRules);
+    return nRules;
+}
+
+bool ReadRule(RouterRuleConfReader& reader, Rule& rule) {
+    reader.GetRuleServiceName(rule.szName);
+    return reader.GetRuleID(rule.szId) != 0 && reader.GetRuleInfo(rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts,
+                                                                  rule.szProtocol, rule.szServiceId) != 0;
+}
+
+std::optional<int> ParsePort(const std::string& szText) {
+    int nPort = 0;
+    const char* pEnd = szText.data() + szText.size();
+    const auto [pRead, error] = std::from_chars(szText.data(), pEnd, nPort);
+    return error == std::errc() && pRead == pEnd && nPort >= 1 && nPort < kPorts ? std::optional(nPort) : std::nullopt;
+}
+
+// The earlier rule of each port of one protocol, as the rules are walked.
+class Owners {
+public:
+    // Books szId's ports; the first one that another rule has, with that rule.
+    void Book(const Rule& rule, const std::vector<int>& rgPorts, const char* szProtocol,
+              std::vector<Overlap>& rgFound) {
+        std::set<std::string> setNamed;
+        for (const int nPort : rgPorts) {
+            const Rule*& pOwner = mRgOwners[static_cast<size_t>(nPort)];
+            if (pOwner == nullptr) {
+                pOwner = &rule;
+            } else if (pOwner != &rule && setNamed.insert(pOwner->szId).second) {
+                rgFound.push_back({rule.szId, pOwner->szId, std::to_string(nPort) + "/" + szProtocol});
+            }
+        }
+    }
+
+private:
+    std::vector<const Rule*> mRgOwners = std::vector<const Rule*>(kPorts);
+};
+
+}  // namespace
+
+const char kUnreadable[] =
+    "/etc/portforward/rule.conf cannot be read as rules; it was left as it is (the system log says where)";
+
+std::optional<Rules> LoadRules() {
+    // The library's own array cuts long values and lends a nameless rule the name of the one before it.
+    RouterRuleConfReader reader(false);
+    Rules rules;
+    for (int nMore = reader.StartNextRule(); nMore != 0; nMore = reader.NextRule()) {
+        Rule rule;
+        if (!ReadRule(reader, rule)) {
+            return std::nullopt;
+        }
+        rules.push_back(rule);
+    }
+    // An absent file and an unreadable one look the same to the reader, but not to this count.
+    return CountReadable() == static_cast<int>(rules.size()) ? std::optional(rules) : std::nullopt;
+}
+
+bool StoreRules(const Rules& rules) {
+    RouterRuleConfWriter writer;
+    return std::all_of(rules.begin(), rules.end(),
+                       [&](const Rule& rule) {
+                           return writer.AddRule(rule.szId, rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts,
+                                                 rule.szProtocol, rule.szServiceId, rule.szName) != 0;
+                       }) &&
+           writer.Sync() != 0;
+}
+
+std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules) {
+    std::vector<__tag_TAVO_ROUTER_RULE> rgRecords(rules.size());
+    for (size_t i = 0; i < rules.size(); ++i) {
+        const Rule& rule = rules[i];
+        __tag_TAVO_ROUTER_RULE& record = rgRecords[i];
+        record.blEnable = rule.blEnabled;
+        if (!Put(record.szRuleID, rule.szId) || !Put(record.szProtocol, rule.szProtocol) ||
+            !Put(record.szRouterPort, rule.szRouterPorts) || !Put(record.szSrcPort, rule.szBoxPorts) ||
+            !Put(record.szServiceID, rule.szServiceId) || !Put(record.szServiceName, rule.szName)) {
+            return std::nullopt;
+        }
+    }
+    return rgRecords;
+}
+
+std::optional<std::vector<int>> ParsePorts(const std::string& szText) {
+    std::vector<int> rgPorts;
+    for (const std::string& szItem : CLI::detail::split(szText, ',')) {
+        const size_t nDash = szItem.find('-');
+        const auto nOne = ParsePort(szItem.substr(0, nDash));
+        const auto nOther = nDash == std::string::npos ? nOne : ParsePort(szItem.substr(nDash + 1));
+        if (!nOne || !nOther || rgPorts.size() >= kPorts) {
+            return std::nullopt;
+        }
+        for (int nPort = std::min(*nOne, *nOther); nPort <= std::max(*nOne, *nOther); ++nPort) {
+            rgPorts.push_back(nPort);
+        }
+    }
+    return rgPorts;
+}
+
+std::vector<Overlap> OverlapsOf(const Rules& rules) {
+    std::vector<Overlap> rgFound;
+    Owners tcp, udp;
+    for (const Rule& rule : rules) {
+        const auto rgPorts = ParsePorts(rule.szRouterPorts);
+        if (!rule.blEnabled || !rgPorts) {
+            continue;
+        }
+        if (rule.szProtocol != "udp") {
+            tcp.Book(rule, *rgPorts, "tcp", rgFound);
+        }
+        if (rule.szProtocol != "tcp") {
+            udp.Book(rule, *rgPorts, "udp", rgFound);
+        }
+    }
+    return rgFound;
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,132 @@
+// Verdicts in words, and settings into their place. Relies on the library's public header. Promises: see
+// Verdict.h.
+#include "Verdict.h"
+
+#include <fmt/format.h>
+
+namespace tavo::cli {
+
+namespace {
+
+struct Warning {
+    int nFlag;
+    const char* szText;
+};
+
+constexpr Warning kWarnings[] = {
+    {1, "the gateway setting of this box looks wrong; compare it with the router's address ('ip route' shows it)"},
+    {2, "it could not be found out whether another router stands between this one and the public network"},
+    {4,
+     "another router stands between this one and the public network, so an open port here is not reachable from "
+     "outside (double NAT). One of these helps:\n"
+     "  - switch the outer router to bridge (modem) mode;\n"
+     "  - forward the same ports on the outer router, too;\n"
+     "  - where the outer router is the provider's, ask the provider for a public address of your own"},
+};
+
+std::string NatWords(int nLevel) {
+    if (nLevel < 0) {
+        return "unknown";
+    }
+    return nLevel == 0 ? "none; this box has a public address"
+                       : fmt::format("{}{}", nLevel, nLevel == 1 ? ", as it should be" : "; one is too many");
+}
+
+Json::Value TextOrNull(const char* szText) {
+    return *szText == '\0' ? Json::Value() : Json::Value(szText);
+}
+
+Json::Value ToJson(const DetectResult& result) {
+    constexpr const char* kWays[] = {"unknown", "natpmp", "upnp", "manual"};
+    Json::Value js;
+    js["kind"] = kWays[static_cast<int>(WayOf(result))];
+    js["upnp"] = SupportWord(result.enSupportUpnp);
+    js["natpmp"] = SupportWord(result.enSupportNatpmp);
+    js["brand"] = TextOrNull(result.szBrand);
+    js["model"] = TextOrNull(result.szModel);
+    js["version"] = TextOrNull(result.szVersion);
+    js["user_setting_name"] = TextOrNull(result.szUserSettingName);
+    js["description"] = TextOrNull(result.szUpnpPfPath);
+    js["max_rules"] = result.nMaxRule < 0 ? Json::Value() : Json::Value(result.nMaxRule);
+    return js;
+}
+
+}  // namespace
+
+Way WayOf(const DetectResult& result) {
+    return WayOf(SupportWord(result.enSupportUpnp), SupportWord(result.enSupportNatpmp));
+}
+
+std::string SupportWord(int enSupport) {
+    char szWord[16] = "unknown";
+    TLibSupportEnumToString(szWord, sizeof(szWord), static_cast<__tag_TAVO_ROUTER_SUPPORT>(enSupport));
+    return szWord;
+}
+
+std::string CapacityWords(int nMaxRules) {
+    return nMaxRules < 0 ? "unknown" : nMaxRules == 0 ? "no limit known" : fmt::format("{} rules", nMaxRules);
+}
+
+std::string OneLine(const DetectResult& result) {
+    const std::string szName = RouterName(result.szBrand, result.szModel, result.szVersion);
+    return ToWords(WayOf(result)) + (szName.empty() ? "" : ", " + szName);
+}
+
+void AddEnvironment(const DetectResult& result, Reply& reply) {
+    reply.jsAnswer["gateway"] = TextOrNull(result.szGateway);
+    reply.jsAnswer["interface"] = TextOrNull(result.szInterface);
+    reply.jsAnswer["error_code"] = result.errCode;
+    reply.jsAnswer["environment_flags"] = result.nEnvFlags;
+    for (const Warning& warning : kWarnings) {
+        if ((result.nEnvFlags & warning.nFlag) != 0) {
+            reply.rgszWarnings.emplace_back(warning.szText);
+        }
+    }
+}
+
+void DescribeVerdict(const DetectResult& result, Reply& reply) {
+    AddEnvironment(result, reply);
+    // Only a detection fills these; a remembered verdict has no surroundings.
+    const bool blFresh = result.nProgress > 0;
+    reply.jsAnswer["public_ip_level"] =
+        blFresh && result.nPublicIPLevel >= 0 ? Json::Value(result.nPublicIPLevel) : Json::Value();
+    reply.jsAnswer["router"] = ToJson(result);
+    const std::string szInterface = Clean(result.szInterface);
+    reply.szBody += Columns({
+        {"gateway", Clean(result.szGateway) + (szInterface.empty() ? "" : " through " + szInterface)},
+        {"driven by", ToWords(WayOf(result))},
+        {"UPnP", SupportWord(result.enSupportUpnp)},
+        {"NAT-PMP", SupportWord(result.enSupportNatpmp)},
+        {"brand", Clean(result.szBrand)},
+        {"model", Clean(result.szModel)},
+        {"version", Clean(result.szVersion)},
+        {"its name", Clean(result.szUserSettingName)},
+        {"description", Clean(result.szUpnpPfPath)},
+        {"holds", WayOf(result) == Way::kManual ? "" : CapacityWords(result.nMaxRule)},
+        {"NATs on the way out", blFresh ? NatWords(result.nPublicIPLevel) : ""},
+    });
+}
+
+Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, int nMaxRules) {
+    // The error is 1 also after success: only the result tells, and the two causes that have a number.
+    auto enError = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
+    if (TLibSetRouterConf(szGateway.c_str(), &conf, &enError, true) != 0) {
+        if (enError == TAVO_LIBTAVOPORTMAP_ERR_CONFLICT) {
+            return Busy();
+        }
+        return Failure(enError == TAVO_LIBTAVOPORTMAP_ERR_SYNTAX_VERSION
+                           ? "the router's description is newer than the tool that carries it out; update the tool "
+                             "(/usr/tavo/bin/tavoportforward). The old settings are still there"
+                           : "the settings could not be stored; the old ones are still there, and the system log says "
+                             "why");
+    }
+    if (nMaxRules >= 0) {
+        if (const auto szFault = RecordMaxRules(conf, nMaxRules)) {
+            return Failure("the settings are stored, but " + *szFault);
+        }
+    }
+    return {.szMessage = fmt::format(
+                "stored as the settings of the router {}; 'tavoportmap save' writes the rules to it", szGateway)};
+}
+
+}  // namespace tavo::cli

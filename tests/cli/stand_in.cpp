@@ -1,0 +1,72 @@
+// Saving and detection as a test wants them to end: preloaded before the library. Relies on TAVO_SAVE
+// ("result status limit limit2" or "result status ports") and TAVO_DETECT ("result error flags level upnp
+// natpmp max percent...", "child" at the end: the forked process returns, too). Promises: calls back as
+// the library does.
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <sstream>
+
+#include "libtavoportmap.h"
+
+namespace {
+
+void Fill(char (&szField)[TAVO_TEXT_SIZE], const char* szValue) {
+    std::snprintf(szField, sizeof(szField), "%s", szValue);
+}
+
+}  // namespace
+
+int TLibSaveRules(const char*, int, __tag_TAVO_ROUTER_RULE*, bool, __tag_TAVO_ROUTER_SAVE_RULE_RESULT* pResult,
+                  void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData) {
+    const char* szWanted = std::getenv("TAVO_SAVE");
+    std::istringstream wanted(szWanted == nullptr ? "-1 0" : szWanted);
+    int nResult = -1;
+    wanted >> nResult >> pResult->nStatus;
+    for (const int nPercent : {20, 40, 60, 80}) {
+        pResult->nProgress = nPercent;
+        pfnCallback(pResult, pData);
+    }
+    if (pResult->nStatus == 8 || pResult->nStatus == 9) {
+        wanted.ignore();
+        wanted.getline(pResult->szPortList, sizeof(pResult->szPortList));
+    } else {
+        wanted >> pResult->nLimit >> pResult->nLimit2;
+    }
+    return nResult;
+}
+
+int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
+                     void (*pfnCallback)(const __tag_TAVO_ROUTER_DETECT_RESULT*, void*), void* pData, bool) {
+    const char* szWanted = std::getenv("TAVO_DETECT");
+    std::istringstream wanted(szWanted == nullptr ? "-1" : szWanted);
+    int nResult = -1;
+    wanted >> nResult >> pResult->errCode >> pResult->nEnvFlags >> pResult->nPublicIPLevel >> pResult->enSupportUpnp >>
+        pResult->enSupportNatpmp >> pResult->nMaxRule;
+    for (int nPercent = 0; wanted >> nPercent;) {
+        pResult->nProgress = nPercent;
+        pfnCallback(pResult, pData);
+    }
+    if (szWanted != nullptr && std::strstr(szWanted, "child") != nullptr) {
+        const pid_t nPid = fork();
+        if (nPid == 0) {
+            // As the library's own child, which returns through both its ends.
+            if (std::strstr(szWanted, "callback") != nullptr) {
+                pfnCallback(pResult, pData);
+            }
+            return -1;
+        }
+        waitpid(nPid, nullptr, 0);
+    }
+    Fill(pResult->szGateway, "192.168.77.1");
+    Fill(pResult->szInterface, "box");
+    Fill(pResult->szBrand, "Acme\x1b]0;x\a");
+    Fill(pResult->szModel, "R1");
+    Fill(pResult->szVersion, "1");
+    pfnCallback(pResult, pData);
+    pResult->nProgress = nResult == 0 ? 100 : pResult->nProgress;
+    return nResult;
+}

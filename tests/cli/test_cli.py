@@ -1,0 +1,333 @@
+"""The command-line tool as a person or a script meets it: arguments in, exit code and text or JSON out.
+
+Runs inside tests/sandbox, with a gateway that answers nobody. What only a router could answer comes from
+stand_in.cpp, preloaded.
+"""
+import fcntl
+import json
+import os
+import pty
+import re
+import shutil
+import subprocess
+import unittest
+
+BUILD = os.environ["TAVO_BUILD_DIR"]
+SOURCE = os.environ["TAVO_SOURCE_DIR"]
+TOOL = f"{BUILD}/cli/tavoportmap"
+STAND_IN = f"{BUILD}/tests/cli/libstand_in.so"
+CONF = "/etc/portforward"
+RULES, ROUTER = f"{CONF}/rule.conf", f"{CONF}/router.conf"
+MODELS = "/etc.defaults/portforward/routerdb"
+GATEWAY = "192.168.77.1"
+OK, FAILED, USAGE, BUSY, REFUSED, TOO_MANY = range(6)
+KNOWN = f"""[{GATEWAY}]
+brand="Acme"
+model="R1"
+version="1"
+support_router_upnp="%s"
+support_router_natpmp="%s"
+"""
+
+
+def tool(*arguments, stdin="", **environment):
+    run = subprocess.run([TOOL, *arguments], input=stdin, text=True, capture_output=True, timeout=60,
+                         env={**os.environ, **environment})
+    return run.returncode, run.stdout, run.stderr
+
+
+def put(path, text):
+    with open(path, "w", encoding="utf-8") as file:
+        file.write(text)
+
+
+def get(path):
+    with open(path, encoding="utf-8") as file:
+        return file.read()
+
+
+def describe(brand, model, version):
+    os.makedirs(f"{MODELS}/{brand}/{model}/{version}", exist_ok=True)
+    put(f"{MODELS}/{brand}/{model}/{version}/router.des", '[global]\nsyntax version="1"\n')
+
+
+def on_terminal(*arguments, **environment):
+    """Exit code and everything that a terminal would have got."""
+    pid, fd = pty.fork()
+    if pid == 0:
+        os.execve(TOOL, [TOOL, *arguments], {**os.environ, "TERM": "xterm", **environment})
+    text = b""
+    try:
+        while chunk := os.read(fd, 4096):
+            text += chunk
+    except OSError:  # the other side is closed
+        pass
+    os.close(fd)
+    return os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), text.decode()
+
+
+class Tool(unittest.TestCase):
+    def setUp(self):
+        shutil.rmtree(MODELS, ignore_errors=True)
+        for path in (RULES, ROUTER, f"{CONF}/router_upnp.db.user"):
+            if os.path.exists(path):
+                os.unlink(path)
+        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="1"\n')
+
+    def json(self, *arguments, **environment):
+        """One document on standard output, nothing beside it, and ok exactly with exit code 0."""
+        code, out, err = tool("--json", *arguments, **environment)
+        self.assertEqual(err, "")
+        answer = json.loads(out)
+        self.assertEqual(answer["ok"], code == OK)
+        return code, answer
+
+    def expect(self, arguments, code, pattern, **environment):
+        got, out, err = tool(*arguments.split(), **environment)
+        with self.subTest(arguments=arguments, **environment):
+            self.assertEqual(got, code, out + err)
+            self.assertRegex(out + err, pattern)
+            self.assertNotIn("\x1b", out + err)
+
+    def rows(self):
+        return [(rule["id"], rule["enabled"], rule["protocol"], rule["router_ports"], rule["box_ports"], rule["name"])
+                for rule in self.json("rules", "list")[1]["rules"]]
+
+    # ---- arguments ------------------------------------------------------------------------------
+
+    def test_wrong_arguments_are_answered_with_the_right_ones(self):
+        for arguments, nearest, pattern in (
+                ("", None, "(?s)Usage.*needs a command: .*save"),
+                ("rules", None, "(?s)Usage: tavoportmap rules.*needs a command: list, add"),
+                ("rulse", "rules", "did you mean 'rules'"),
+                ("rules lsit", "list", "did you mean 'list'.*\n.*list, add, remove, enable, disable"),
+                ("rules enabl 1", "enable", "did you mean 'enable'"),
+                ("xyzzy", None, "there is no command 'xyzzy'\n"),
+                ("rules add --nmae x", "--name", "no option '--nmae' for 'rules add'; did you mean '--name'"),
+                ("save --jsno", "--json", "did you mean '--json'"),
+                ("router set --password x", "--password-file", "no option '--password'.*\n.*--password-file"),
+                ("rules add", None, "--router-port is required"),
+                ("rules remove", None, "id is required"),
+                ("save now", None, "'now' is one word too many for 'save'"),
+                ("rules add --router-port 1 --protocol tpc", None, "none of tcp, udp, all; did you mean 'tcp'"),
+                ("router set --conn-port 70000", None, "'70000' is no whole number from 1 to 65535"),
+                ("router set", None, "nothing to set; for example"),
+                ("rules add --router-port 0", None, "'0' is no port list: write ports from 1 to 65535"),
+                ("rules add --router-port 1-3 --box-port 1", None, "3 router ports but 1 box ports"),
+                ("rules remove 4", None, "there is no rule 4; none is stored")):
+            self.expect(arguments, USAGE, pattern)
+            code, answer = self.json(*arguments.split())
+            self.assertEqual((code, answer.get("did_you_mean")), (USAGE, nearest), arguments)
+
+    def test_help_and_man_page_know_every_command_and_option(self):
+        page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
+        for command in ("", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
+                        "rules enable", "rules disable", "save", "status"):
+            code, out, err = tool(*command.split(), "--help")
+            self.assertEqual((code, err), (OK, ""), command)
+            self.assertIn(command, page)
+            for option in re.findall(r"--[a-z-]+", out):
+                self.assertIn(option, page, f"{option} of '{command}'")
+        self.assertIn("Usage", self.json("rules", "--help")[1]["help"])
+
+    # ---- rules ----------------------------------------------------------------------------------
+
+    def test_rules_round_trip(self):
+        self.expect("rules list", OK, "no rules are stored yet; add one, for example\n.*rules add web")
+        self.expect("rules add web --router-port 443 --box-port 8443", OK, "rule 1 stored")
+        self.expect("rules add --name dns --protocol all --router-port 53,5000-5001 --disabled", OK, "rule 2 stored")
+        self.expect("rules add --router-port 443", USAGE, "rule 1 already forwards router port 443/tcp")
+        self.expect("rules add --router-port 443 --protocol udp", OK, "rule 3 stored")
+        self.expect("rules add --router-port 400-500 --force", OK, "rule 4 stored(?s:.)*rules 1 and 4 both want")
+        self.expect("rules disable 4", OK, "stored")
+        self.expect("rules enable 4", USAGE, "rule 1 already forwards router port 443/tcp")
+        self.expect("rules enable 2", OK, "stored")
+        self.expect("rules remove 3", OK, "stored")
+        self.expect("rules remove 3", USAGE, "there is no rule 3; the rules are 1, 2, 4")
+        self.assertEqual(self.rows(), [("1", True, "tcp", "443", "8443", "web"),
+                                       ("2", True, "all", "53,5000-5001", "53,5000-5001", "dns"),
+                                       ("4", False, "tcp", "400-500", "400-500", "")])
+
+    def test_a_change_touches_nothing_else(self):
+        long_name = "n" * 1500
+        put(RULES, f'[2147483647]\nenabled="1"\nprotocol name="tcp"\nr_port="80"\ns_port="80"\nservice="{long_name}"\n'
+                   '[relay]\nenabled="0"\nprotocol name="udp"\nr_port="81"\ns_port="82"\nservice_id="HopLink"\n')
+        before = self.json("rules", "list")[1]["rules"]
+        self.expect("rules add --router-port 90", OK, "rule 1 stored")
+        self.expect("rules disable 1", OK, "stored")
+        self.assertEqual(self.json("rules", "list")[1]["rules"][:2], before)
+        self.assertEqual([rule["name"] for rule in before], [long_name, ""])
+        self.expect("save", FAILED, "longer than the library takes", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
+
+    def test_an_unreadable_file_is_left_alone(self):
+        for text in ("\0\1 no rules\n", '[1]\nenabled="1"\n'):
+            put(RULES, text)
+            for arguments in ("rules add --router-port 80", "rules list", "rules remove 1", "save"):
+                self.expect(arguments, FAILED, "cannot be read as rules; it was left as it is")
+            self.assertEqual(get(RULES), text)
+            self.expect("status", OK, "rules +unreadable")
+
+    def test_hostile_texts_do_not_reach_the_terminal(self):
+        name = "\x1b[2Jx\r\n\u202eevil\u009b31m\x7f"
+        self.assertEqual(tool("rules", "add", name, "--router-port", "80")[0], OK)
+        self.assertEqual(self.rows()[0][5], name)
+        put(ROUTER, KNOWN.replace("Acme", r"\x1b]0;owned\x07") % ("yes", "no"))
+        for arguments in (("rules", "list"), ("rules", name), ("rules", "remove", name), ("status",), ("router", "show"),
+                          ("rules", "add", "--router-port", name)):
+            code, text = on_terminal(*arguments, NO_COLOR="1")
+            self.assertFalse(set("\x1b\x07\x7f\u009b\u202e") & set(text), (arguments, text))
+        self.assertIn(r"\x1b[2Jx\x0d\x0a\u{202e}evil\u{9b}31m\x7f", tool("rules", "list")[1])
+
+    def test_only_a_terminal_gets_colours(self):
+        tool("rules", "add", "--router-port", "80")
+        for environment, coloured in (({}, True), ({"NO_COLOR": "1"}, False), ({"TERM": "dumb"}, False)):
+            self.assertEqual("\x1b[1m" in on_terminal("rules", "list", **environment)[1], coloured, environment)
+
+    def test_a_held_lock_is_told_apart(self):
+        tool("rules", "add", "--router-port", "80")
+        put(ROUTER, KNOWN % ("yes", "no"))
+        with open("/tmp/routerconf.lock", "w", encoding="utf-8") as lock:
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            for arguments in ("rules add --router-port 81", "rules remove 1", "save", "router show",
+                              "router set --upnp no --natpmp yes", "detect"):
+                self.expect(arguments, BUSY, "another port-forwarding operation is running")
+            self.expect("status", OK, "rules +1")
+            self.assertEqual(self.json("save")[1]["status"], 2)
+        self.expect("rules remove 1", OK, "stored")
+
+    def test_an_answer_that_cannot_be_written_is_a_failure(self):
+        with open("/dev/full", "w", encoding="utf-8") as full:
+            self.assertEqual(subprocess.run([TOOL, "rules", "list"], stdout=full, check=False).returncode, FAILED)
+
+    # ---- saving ---------------------------------------------------------------------------------
+
+    def test_every_status_of_saving_is_explained(self):
+        tool("rules", "add", "--router-port", "80")
+        put(ROUTER, KNOWN % ("yes", "no"))
+        for answer, code, pattern in (
+                ("0 0", OK, "1 rule in force on the router 192.168.77.1"),
+                ("-1 2", BUSY, "another port-forwarding operation"),
+                ("-1 7 5", TOO_MANY, "holds 5 rules and there are 1\nNothing was changed"),
+                ("-1 8 5000/tcp, 53/udp", REFUSED, "already holds these ports.*: 5000/tcp, 53/udp\nThe other rules are in force"),
+                ("-1 8 \x1b[31m", REFUSED, r"router: \\x1b\[31m"),
+                ("-1 9 80/tcp", REFUSED, "refused these ports: 80/tcp(?s:.)*upnp_portmap.status"),
+                ("-1 10 -1", TOO_MANY, "do not fit this router"),
+                ("-1 10 4", TOO_MANY, "4 single ports and no ranges"),
+                ("-1 11 4", TOO_MANY, "4 entries, each one port or one range"),
+                ("-1 12 4 2", TOO_MANY, "4 single ports and 2 ranges"),
+                ("-1 0", FAILED, "daemon could not be started(?s:.)*journalctl")):
+            self.expect("save", code, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE=answer)
+            self.assertEqual(self.json("save", LD_PRELOAD=STAND_IN, TAVO_SAVE=answer)[1]["status"], int(answer.split()[1]))
+        put(ROUTER, KNOWN % ("yes", "yes"))
+        self.expect("save", REFUSED, "would not give these ports.*80 to 81", LD_PRELOAD=STAND_IN, TAVO_SAVE="-1 8 80 to 81")
+        put(ROUTER, KNOWN % ("no", "no"))
+        self.expect("save", OK, "handed to(?s:.)*warning: .*does not say what it took", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
+
+    def test_saving_by_the_library_itself(self):
+        tool("rules", "add", "--router-port", "80")
+        self.expect("save", FAILED, "nothing is known of the router 192.168.77.1 yet(?s:.)*detect --save")
+        put(ROUTER, (KNOWN % ("yes", "no")).replace(GATEWAY, "10.0.0.1").replace("R1", "R2"))
+        self.expect("save", FAILED, "is about another router than 192.168.77.1")
+        put(ROUTER, (KNOWN % ("yes", "no")).replace("R1", "R2"))
+        self.expect("save", FAILED, r"how many rules the router Acme R2 \(1\) holds(?s:.)*--max-rules")
+        put(ROUTER, KNOWN % ("no", "no"))
+        self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*routers --update")
+        put(ROUTER, KNOWN % ("yes", "no"))
+        tool("rules", "add", "--router-port", "81")
+        self.expect("save", TOO_MANY, "holds 1 rules and there are 2")
+
+    def test_the_bar_never_goes_back_and_ends_its_line(self):
+        steps = "10 20 30 40 70 50 80"
+        for command, environment in ((("save",), {"TAVO_SAVE": "-1 9 80/tcp"}),
+                                     (("detect",), {"TAVO_DETECT": f"-1 4 0 1 2 2 -1 {steps}"})):
+            code, text = on_terminal(*command, LD_PRELOAD=STAND_IN, **environment)
+            percents = [int(percent) for percent in re.findall(r"(\d+) %", text)]
+            self.assertNotEqual(code, OK)
+            self.assertGreaterEqual(len(percents), 4)
+            self.assertEqual(percents, sorted(percents))
+            bar, verdict = text.split("\r\n", 1)
+            self.assertEqual(bar.count("\r"), len(percents))
+            self.assertIn("error", verdict)
+            self.assertNotIn("\r[", verdict)
+        self.assertIn("trying to resolve a name", bar)
+
+    # ---- the router -----------------------------------------------------------------------------
+
+    def test_verdicts_of_detection(self):
+        steps = "10 20 30 40 70 50 80"
+        for answer, code, pattern in (
+                (f"0 0 0 1 1 0 32 {steps}", OK, r"driven by +UPnP\n(?s:.)*Acme\\x1b(?s:.)*holds +32 rules(?s:.)*--last --save"),
+                (f"0 0 0 1 2 1 0 {steps}", OK, "driven by +NAT-PMP(?s:.)*no limit known"),
+                (f"0 0 0 1 0 0 -1 {steps}", OK, "driven by +manual(?s:.)*--conn-type http"),
+                (f"0 0 0 1 2 0 -1 {steps}", OK, "driven by +unknown(?s:.)*--upnp yes"),
+                (f"0 0 5 2 1 0 32 {steps}", OK, "(?s)gateway setting.*double NAT.*bridge.*outer router, too.*public address"),
+                (f"0 0 2 -1 1 0 32 {steps}", OK, "could not be found out whether another router"),
+                (f"-1 0 0 1 1 0 -1 {steps}", FAILED, "(?s)driven by +UPnP.*not in the compatibility database.*--max-rules"),
+                ("-1 2 0 0 0 0 -1 10", BUSY, "another port-forwarding operation"),
+                ("-1 3 0 0 0 0 -1 10 20 30 40", FAILED, "Internet cannot be reached"),
+                ("-1 4 0 1 0 0 -1 10 20 30 40 70 50", FAILED, "names cannot be resolved"),
+                ("-1 0 0 0 0 0 -1 10 20", FAILED, "no network interface is up")):
+            self.expect("detect", code, pattern, LD_PRELOAD=STAND_IN, TAVO_DETECT=answer)
+            self.assertEqual(self.json("detect", LD_PRELOAD=STAND_IN, TAVO_DETECT=answer)[0], code)
+
+    def test_the_child_of_detection_says_nothing(self):
+        for ending in ("child", "child callback"):
+            code, out, err = tool("detect", LD_PRELOAD=STAND_IN, TAVO_DETECT=f"0 0 0 1 1 0 32 10 80 {ending}")
+            self.assertEqual((code, out.count("gateway "), err.count("80 %")), (OK, 1, 1), out + err)
+
+    def test_settings_round_trip(self):
+        self.expect("router show", OK, "nothing is stored for the router 192.168.77.1 yet")
+        self.expect("router set --brand Acme --upnp no", USAGE, "needs --conn-type and --conn-port")
+        self.expect("router set --upnp yes --brand Acme --model R9 --version 2", OK, "stored as the settings")
+        self.expect("router show", OK, "driven by +UPnP\n(?s:.)*holds +unknown(?s:.)*nobody has recorded how many rules")
+        self.expect("router set --max-rules 20", OK, "stored as the settings")
+        self.expect("router show", OK, "model +R9\n(?s:.)*holds +20 rules\n")
+        self.expect("router set --model R1 --version 1 --max-rules 20", FAILED, "says that this router holds 1 rules")
+        self.assertEqual(self.json("router", "show")[1]["router"]["max_rules"], 1)
+        self.expect("status", OK, r"settings +Acme R1 \(1\), driven by UPnP")
+        self.expect("detect --save", OK, "stored as the settings", LD_PRELOAD=STAND_IN,
+                    TAVO_DETECT="0 0 0 1 0 1 32 10 80")
+        self.assertEqual(self.json("router", "show")[1]["router"]["natpmp"], "yes")
+
+    def test_settings_that_cannot_be_read_stay(self):
+        put(ROUTER, "\0\1 no settings\n")
+        self.expect("router show", FAILED, "cannot be read as settings; it was left as it is")
+        self.expect("router set --upnp yes", FAILED, "cannot be read as settings")
+        self.assertEqual(get(ROUTER), "\0\1 no settings\n")
+
+    def test_the_password_is_shown_only_on_request(self):
+        manual = (KNOWN % ("no", "no")) + 'conn_type="http"\nconn_port="80"\nuser="admin"\npass="s3cret"\n'
+        put(ROUTER, manual + 'use_custom_account="yes"\n')
+        self.expect("router show", OK, "password +set, not shown(?s:.)*http, port 80")
+        self.assertNotIn("s3cret", tool("--json", "router", "show")[1])
+        self.expect("router show --show-password", OK, "password +s3cret\n")
+        self.expect("router set --user root", USAGE, "no terminal to ask.*--password-file")
+        # A manual router is stored only with a description that the tool which carries it out understands.
+        describe("Acme", "R1", "1")
+        code, _, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
+        self.assertEqual((code, "newer than the tool" in err), (FAILED, True), err)
+        self.expect("router show --show-password", OK, "password +s3cret\n")
+        os.makedirs("/usr/tavo/bin", exist_ok=True)
+        put("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho syntax version=1\n")
+        os.chmod("/usr/tavo/bin/tavoportforward", 0o755)
+        code, out, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
+        self.assertEqual(code, OK, err)
+        self.expect("router show --show-password", OK, "user +admin\npassword +n3w\n")
+
+    def test_models(self):
+        os.makedirs(MODELS)
+        self.expect("routers", OK, "no router descriptions are installed; 'tavoportmap routers --update'")
+        for brand, model, version in (("Acme", "R1", "1.0"), ("Acme", "R2 Plus", "2.0"), ("Zeta", "Z", "1")):
+            describe(brand, model, version)
+        for search, models in (((), ["R1", "R2 Plus", "Z"]), (("ACME",), ["R1", "R2 Plus"]), (("plus", "acme"), ["R2 Plus"])):
+            self.assertEqual([router["model"] for router in self.json("routers", *search)[1]["routers"]], models)
+        self.expect("routers nothere", OK, "none of the 3 known routers matches")
+        self.expect("routers --update", FAILED, "could not be updated; the ones that were there still are")
+
+
+if __name__ == "__main__":
+    os.makedirs(CONF, exist_ok=True)
+    for step in ("link add box type veth peer name router", "addr add 192.168.77.2/24 dev box", "link set box up",
+                 "link set router up", f"route add default via {GATEWAY}"):
+        subprocess.run(["ip", *step.split()], check=True)
+    unittest.main()
