@@ -21,6 +21,8 @@ GATEWAY, BOX, LAN2 = "192.168.77.1", "192.168.77.2", "192.168.77.3"
 ROUTER_WAN, WAN = "203.0.113.2", "203.0.113.9"
 PUBLIC = "198.41.0.4"  # what the daemon says its outside address is; it refuses reserved ones
 STATUS = "/var/tmp/upnp_portmap.status"
+REMAP = "/var/tmp/natpmp_portmap.remap"
+DAEMONS = ("upnpd", "natpmpd")
 
 NFT = """
 table inet home {
@@ -134,25 +136,34 @@ class Lab:
 
     # ---- the box's files ------------------------------------------------------------------------
 
-    def install(self):
+    def install(self, natpmp=False):
         for directory in ("/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/sbin",
                           "/usr/tavo/bin", "/etc/tavo"):
             os.makedirs(directory, exist_ok=True)
-        for source, target in (("platform/linux/daemons/upnpd", "/usr/tavo/sbin/upnpd"),
-                               ("platform/linux/daemons/tavoairportd", "/usr/tavo/sbin/tavoairportd"),
-                               ("platform/linux/daemons/tavoportforward", "/usr/tavo/bin/tavoportforward")):
-            if os.path.lexists(target):
-                os.unlink(target)
-            os.symlink(f"{BUILD}/{source}", target)
+        for program in (*(f"sbin/{daemon}" for daemon in DAEMONS), "sbin/tavoairportd", "bin/tavoportforward"):
+            if os.path.lexists(f"/usr/tavo/{program}"):
+                os.unlink(f"/usr/tavo/{program}")
+            os.symlink(f"{BUILD}/platform/linux/daemons/{os.path.basename(program)}", f"/usr/tavo/{program}")
         self.settings()
-        self.write("/etc/portforward/router.conf",
-                   f'[{GATEWAY}]\nbrand="Lab"\nmodel="One"\nversion="1"\n'
-                   'support_router_upnp="yes"\nsupport_router_natpmp="no"\n')
+        self.router_conf(natpmp)
         self.write("/etc/portforward/router_upnp.db", '[Lab/One/1]\nsupport="yes"\nmax="100"\n')
 
     def settings(self, check_interval=120, lease=3600):
-        self.write("/etc/tavo/platform.conf",
-                   f'[upnpd]\ncheck_interval="{check_interval}"\nlease="{lease}"\n')
+        self.write("/etc/tavo/platform.conf", "".join(
+            f'[{daemon}]\ncheck_interval="{check_interval}"\nlease="{lease}"\n' for daemon in DAEMONS))
+
+    def router_conf(self, natpmp):
+        self.write("/etc/portforward/router.conf",
+                   f'[{GATEWAY}]\nbrand="Lab"\nmodel="One"\nversion="1"\nsupport_router_upnp="yes"\n'
+                   f'support_router_natpmp="{"yes" if natpmp else "no"}"\n')
+
+    @staticmethod
+    def clear_state(*more):
+        """What a save and the daemons leave behind."""
+        for path in ("/etc/portforward/rule.conf", "/tmp/pfProgress", "/var/lib/tavo/upnp_igd.conf",
+                     "/var/lib/tavo/natpmp_held.conf", *more):
+            if os.path.exists(path):
+                os.unlink(path)
 
     @staticmethod
     def write(path, text):
@@ -175,20 +186,21 @@ class Lab:
             process.kill()
         process.wait()
 
-    def daemon_pid(self):
+    def daemon_pid(self, daemon="upnpd"):
         try:
-            with open("/var/run/upnpd.pid", encoding="ascii") as file:
+            with open(f"/var/run/{daemon}.pid", encoding="ascii") as file:
                 pid = int(file.read())
             os.kill(pid, 0)
             return pid
         except (OSError, ValueError):
             return 0
 
-    def stop_daemon(self, how=signal.SIGTERM):
-        pid = self.daemon_pid()
-        if pid:
-            os.kill(pid, how)
-            wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 15, "the daemon has ended")
+    def stop_daemon(self, how=signal.SIGTERM, *daemons):
+        for daemon in daemons or DAEMONS:
+            pid = self.daemon_pid(daemon)
+            if pid:
+                os.kill(pid, how)
+                wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 15, "the daemon has ended")
 
     def close(self):
         self.stop_daemon(signal.SIGKILL)
@@ -352,6 +364,10 @@ class Lab:
             return dict(line.rstrip("\n").split("=", 1) for line in file)
 
 
+def only_box(mappings):
+    return {key: port for key, (host, port) in mappings.items() if host == BOX}
+
+
 def in_lab(main):
     lab = Lab()
     try:
@@ -361,8 +377,10 @@ def in_lab(main):
 
 
 def run_tests(tests):
-    """Runs the cases of the calling file, each as tests(lab) prepares them, and prints a summary."""
+    """Runs the cases of the calling file, which find the lab as LAB, as tests(lab) prepares them, and prints a
+    summary."""
     def main(lab):
+        sys.modules["__main__"].LAB = lab
         tests(lab)
         result = unittest.main(exit=False, verbosity=2, warnings="ignore").result
         failed = min(result.testsRun, len(result.failures) + len(result.errors))

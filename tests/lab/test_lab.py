@@ -5,13 +5,9 @@ import signal
 import unittest
 
 import homelab
-from homelab import BOX, GATEWAY, LAN2, wait_for
+from homelab import BOX, GATEWAY, LAN2, only_box, wait_for
 
 LAB = None
-
-
-def only_box(mappings):
-    return {key: port for key, (host, port) in mappings.items() if host == BOX}
 
 
 class RealRouter(unittest.TestCase):
@@ -24,9 +20,7 @@ class RealRouter(unittest.TestCase):
     def tearDown(self):
         LAB.stop_daemon(signal.SIGKILL)
         LAB.stop_router()
-        for path in ("/etc/portforward/rule.conf", "/tmp/pfProgress", "/var/lib/tavo/upnp_igd.conf"):
-            if os.path.exists(path):
-                os.unlink(path)
+        LAB.clear_state()
 
     def test_three_saves_in_a_row(self):
         steps = (
@@ -196,15 +190,8 @@ class FaultyRouter(unittest.TestCase):
                 finally:
                     LAB.stop_daemon(signal.SIGKILL)
                     LAB.end(LAB.router)
-                    if os.path.exists("/var/lib/tavo/upnp_igd.conf"):
-                        os.unlink("/var/lib/tavo/upnp_igd.conf")
-
-
-def prepare(lab):
-    global LAB
-    LAB = lab
-    lab.serve(5001, 5002, 5003, 5004)
+                    LAB.clear_state()
 
 
 if __name__ == "__main__":
-    homelab.run_tests(prepare)
+    homelab.run_tests(lambda lab: lab.serve(5001, 5002, 5003, 5004))

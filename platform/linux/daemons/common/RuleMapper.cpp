@@ -42,6 +42,7 @@ void RuleMapper::ReadRules() {
     WantedSet wanted = ReadWanted(mNames.szRunKey);
     if (wanted.blReadable) {
         mWanted = std::move(wanted);
+        mBlRulesRead = true;
     } else {
         mWanted.blReadable = false;
         syslog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
@@ -88,6 +89,9 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
         result.nTransport = IsSwitchedOn() ? kRouterTimeout : kRouterOk;
         result.blStopped = fnStop();
         return result;
+    }
+    if (!mBlRulesRead) {
+        return {};  // not knowing the rules is no reason to take anything away
     }
     if (!FindGateway()) {
         return Failed(mWanted.rgMappings, "nogateway");

@@ -60,6 +60,7 @@ private:
     int mNCheckSeconds;
     uint32_t mNWishedLease;
     WantedSet mWanted;
+    bool mBlRulesRead = false;
     RouterTurn mTurn;
     std::string mSzGateway;
     std::string mSzBox;

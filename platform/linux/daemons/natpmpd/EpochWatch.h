@@ -1,0 +1,38 @@
+// Tells from a gateway's "seconds since start" whether it has lost its mappings since it last spoke.
+// Relies on a clock that goes on while the box sleeps. Promises: a gateway whose clock is up to an
+// eighth slow, or two seconds off, counts as one that went on.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <utility>
+
+#include "daemons/common/BootClock.h"
+
+namespace tavo {
+
+class EpochWatch {
+public:
+    bool IsRestart(uint32_t nEpoch, BootClock::time_point now) const {
+        const int64_t nElapsed = std::chrono::duration_cast<std::chrono::seconds>(now - mSeen).count();
+        return mBlKnown && int64_t{nEpoch} + kToleranceSeconds < int64_t{mNEpoch} + nElapsed * 7 / 8;
+    }
+    void Note(uint32_t nEpoch, BootClock::time_point now) {
+        mBlRestarted = mBlRestarted || IsRestart(nEpoch, now);
+        mNEpoch = nEpoch;
+        mSeen = now;
+        mBlKnown = true;
+    }
+    // Whether the gateway has restarted since this was last asked.
+    bool TakeRestart() { return std::exchange(mBlRestarted, false); }
+
+private:
+    static constexpr int64_t kToleranceSeconds = 2;
+
+    bool mBlKnown = false;
+    bool mBlRestarted = false;
+    uint32_t mNEpoch = 0;
+    BootClock::time_point mSeen;
+};
+
+}  // namespace tavo

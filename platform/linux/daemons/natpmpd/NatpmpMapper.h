@@ -1,0 +1,30 @@
+// The mapping side of natpmpd: the gateway's NAT-PMP mappings kept in line with the rules.
+// Relies on NatpmpPass and on the gateway's announcements. Promises: see RuleMapper.h; a gateway that
+// restarts gets every mapping again, at once when it announces its return.
+#pragma once
+
+#include <string>
+
+#include "core/Descriptor.h"
+#include "daemons/common/RuleMapper.h"
+#include "daemons/natpmpd/NatpmpPass.h"
+
+namespace tavo {
+
+class NatpmpMapper : public RuleMapper {
+public:
+    NatpmpMapper();
+    int WakeFd() const override { return mFdAnnouncements.Get(); }
+    bool OnWake() override;
+
+private:
+    PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+                   const std::function<bool()>& fnStop) override;
+    std::string ResultText(const StatusList& rgStatus) const override;
+    void NewGateway() override;
+
+    Descriptor mFdAnnouncements;
+    NatpmpState mState;
+};
+
+}  // namespace tavo

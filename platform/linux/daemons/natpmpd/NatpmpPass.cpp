@@ -1,0 +1,176 @@
+// Brings one gateway in line: takes away, then asks, then believes only the answer.
+// Relies on NatpmpClient. Promises: see NatpmpPass.h.
+#include "daemons/natpmpd/NatpmpPass.h"
+
+#include <syslog.h>
+
+#include <algorithm>
+
+#include "daemons/common/Wanted.h"
+
+namespace tavo {
+
+namespace {
+
+// A gateway keeps one mapping for each port of the box and ends it by that port. Asking for a second one
+// would be answered with the first, and giving that back would end it.
+constexpr char kShared[] = "another rule has this port of the box; NAT-PMP gives it one router port only";
+
+}  // namespace
+
+NatpmpPass::NatpmpPass(NatpmpState& state, const std::string& szGateway, const std::string& szBox,
+                       uint32_t nWishedLease, const std::function<bool()>& fnStop)
+    : mState(state),
+      mSzGateway(szGateway),
+      mSzBox(szBox),
+      mNWishedLease(nWishedLease),
+      mClient(szGateway, fnStop, [&state](uint32_t nEpoch) { state.epoch.Note(nEpoch, BootClock::now()); }),
+      mGuard(mResult, fnStop) {}
+
+std::vector<HeldKey> NatpmpPass::HeldHere() const {
+    std::vector<HeldKey> rgKeys;
+    for (const auto& [key, held] : mState.held.mRows) {
+        if (key.szGateway == mSzGateway && key.szBox == mSzBox) {
+            rgKeys.push_back(key);
+        }
+    }
+    return rgKeys;
+}
+
+bool NatpmpPass::IsWanted(const HeldKey& key) const {
+    const auto it = mMapWanted.find(key);
+    return it != mMapWanted.end() && it->second->nRouterPort == mState.held.mRows.at(key).nRouterPort;
+}
+
+// Nothing that the gateway once granted counts any more.
+void NatpmpPass::Doubt() {
+    for (const HeldKey& key : HeldHere()) {
+        mState.held.mRows[key].nLifetime = 0;
+    }
+    mState.mapRemapped.clear();
+    mResult.blRenewed = true;
+}
+
+PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRenew) {
+    for (const RouterMapping& wanted : rgWanted) {
+        mMapWanted.emplace(KeyOf(wanted), &wanted);  // the first rule that asks for a port of the box has it
+    }
+    mState.held.Prune();
+    if (rgWanted.empty() && HeldHere().empty()) {
+        return mResult;
+    }
+    // One question that changes nothing tells whether the gateway answers, and whether it has restarted.
+    std::string szPublic;
+    const int nCode = mClient.AskAddress(szPublic);
+    const bool blRestarted = mState.epoch.TakeRestart();
+    if (blRestarted) {
+        syslog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
+    }
+    if (blRenew || blRestarted || mState.blSilent) {
+        Doubt();
+    }
+    mResult.nTransport = std::min(nCode, int{kRouterOk});
+    RemoveUnwanted();
+    NoteIntents();
+    PlaceAll(rgWanted);
+    if (mState.epoch.TakeRestart()) {  // it restarted while we spoke
+        Doubt();
+        NoteIntents();
+        PlaceAll(rgWanted);
+    }
+    mState.held.Save();
+    mState.blSilent = mResult.nTransport != kRouterOk;
+    NoteLease();
+    mResult.rgStatus.insert(mResult.rgStatus.end(), mRgOpen.begin(), mRgOpen.end());
+    return mResult;
+}
+
+void NatpmpPass::ReportOpen(const HeldKey& key, int nCode) {
+    const RouterMapping mapping{key.szProtocol, mState.held.mRows.at(key).nRouterPort, key.nBoxPort, "", "", 0, true};
+    mRgOpen.emplace_back(MappingName(mapping), "still open: " + NatpmpWords(nCode));
+}
+
+// Takes away what the rules no longer ask for, and what they ask for at another router port.
+void NatpmpPass::RemoveUnwanted() {
+    for (const HeldKey& key : HeldHere()) {
+        if (IsWanted(key)) {
+            continue;
+        }
+        const int nCode =
+            mGuard.IsOver() ? mResult.nTransport : mGuard.Note(mClient.Unmap(key.szProtocol, key.nBoxPort));
+        if (nCode == kRouterOk && !mResult.blStopped) {
+            mState.held.mRows.erase(key);
+        } else {
+            ReportOpen(key, nCode);
+        }
+    }
+}
+
+void NatpmpPass::NoteIntents() {
+    for (const auto& [key, pWanted] : mMapWanted) {
+        if (mState.mapRemapped.count(MappingName(*pWanted)) == 0) {
+            mState.held.mRows.emplace(key, Held{pWanted->nRouterPort, 0, std::time(nullptr) + mNWishedLease});
+        }
+    }
+    mState.held.Save();
+}
+
+void NatpmpPass::PlaceAll(const std::vector<RouterMapping>& rgWanted) {
+    mResult.rgStatus.clear();
+    for (const RouterMapping& wanted : rgWanted) {
+        const bool blShared = mMapWanted.at(KeyOf(wanted)) != &wanted;
+        const std::string szStatus =
+            mGuard.IsOver() ? NatpmpWords(mResult.nTransport) : (blShared ? kShared : Place(wanted));
+        mResult.rgStatus.emplace_back(MappingName(wanted), szStatus);
+    }
+}
+
+std::string NatpmpPass::Place(const RouterMapping& wanted) {
+    const auto remapped = mState.mapRemapped.find(MappingName(wanted));
+    if (remapped != mState.mapRemapped.end()) {
+        return remapped->second;
+    }
+    Held& held = mState.held.mRows.at(KeyOf(wanted));
+    if (held.nRouterPort != wanted.nRouterPort) {
+        return "the router has not closed port " + std::to_string(held.nRouterPort) + " yet";
+    }
+    return held.nLifetime != 0 ? "1" : Ask(wanted, held);
+}
+
+std::string NatpmpPass::Ask(const RouterMapping& wanted, Held& held) {
+    NatpmpGrant grant;
+    const int nCode =
+        mGuard.Note(mClient.Map(wanted.szProtocol, wanted.nBoxPort, wanted.nRouterPort, mNWishedLease, grant));
+    if (nCode != kRouterOk) {
+        held = {wanted.nRouterPort, 0, std::max(held.nExpiry, std::time(nullptr) + time_t{mNWishedLease})};
+        return NatpmpWords(nCode);
+    }
+    held = {grant.nRouterPort, grant.nLifetime, std::time(nullptr) + time_t{grant.nLifetime}};
+    return grant.nRouterPort == wanted.nRouterPort ? "1" : HandBack(wanted);
+}
+
+// The gateway opened a port that nobody asked for: it is closed before anything else is done.
+std::string NatpmpPass::HandBack(const RouterMapping& wanted) {
+    const HeldKey key = KeyOf(wanted);
+    std::string szWords = "the router offered " + std::to_string(mState.held.mRows.at(key).nRouterPort);
+    const int nCode = mGuard.Note(mClient.Unmap(wanted.szProtocol, wanted.nBoxPort));
+    if (nCode != kRouterOk) {
+        return szWords + " and has not closed it yet: " + NatpmpWords(nCode);
+    }
+    mState.held.mRows.erase(key);
+    mState.mapRemapped[MappingName(wanted)] = szWords;
+    syslog(LOG_WARNING, "%s: %s; given back", MappingName(wanted).c_str(), szWords.c_str());
+    return szWords;
+}
+
+void NatpmpPass::NoteLease() {
+    mResult.nShortestLease = mMapWanted.empty() ? 0 : mNWishedLease;
+    for (const HeldKey& key : HeldHere()) {
+        const uint32_t nLifetime = mState.held.mRows.at(key).nLifetime;
+        if (nLifetime != 0 && IsWanted(key)) {
+            mResult.nShortestLease = std::min(mResult.nShortestLease, nLifetime);
+        }
+    }
+}
+
+}  // namespace tavo

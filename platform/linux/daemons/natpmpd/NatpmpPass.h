@@ -1,0 +1,61 @@
+// One pass over the NAT-PMP mappings of one gateway. Relies on NatpmpClient and on what is held.
+// Promises: what the rules do not ask for is taken away, what they ask for is there or reported; every
+// mapping is on disk as possibly there before the gateway is asked for it.
+#pragma once
+
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "daemons/common/Pass.h"
+#include "daemons/natpmpd/EpochWatch.h"
+#include "daemons/natpmpd/HeldMappings.h"
+#include "natpmp/NatpmpClient.h"
+
+namespace tavo {
+
+// What is known of the gateway, kept between passes.
+struct NatpmpState {
+    HeldMappings held;
+    EpochWatch epoch;
+    bool blSilent = false;  // it did not answer the last time, and may have been restarting
+    // Mapping names, each with what the gateway offered instead. They are asked for again when leases are
+    // renewed and not at each check, because each asking opens a wrong port for a moment.
+    std::map<std::string, std::string> mapRemapped;
+};
+
+class NatpmpPass {
+public:
+    NatpmpPass(NatpmpState& state, const std::string& szGateway, const std::string& szBox, uint32_t nWishedLease,
+               const std::function<bool()>& fnStop);
+    PassResult Run(const std::vector<RouterMapping>& rgWanted, bool blRenew);
+
+private:
+    HeldKey KeyOf(const RouterMapping& mapping) const {
+        return {mSzGateway, mSzBox, mapping.szProtocol, mapping.nBoxPort};
+    }
+    std::vector<HeldKey> HeldHere() const;
+    bool IsWanted(const HeldKey& key) const;
+    void Doubt();
+    void RemoveUnwanted();
+    void NoteIntents();
+    void PlaceAll(const std::vector<RouterMapping>& rgWanted);
+    std::string Place(const RouterMapping& wanted);
+    std::string Ask(const RouterMapping& wanted, Held& held);
+    std::string HandBack(const RouterMapping& wanted);
+    void ReportOpen(const HeldKey& key, int nCode);
+    void NoteLease();
+
+    NatpmpState& mState;
+    const std::string& mSzGateway;
+    const std::string& mSzBox;
+    uint32_t mNWishedLease;
+    NatpmpClient mClient;
+    std::map<HeldKey, const RouterMapping*> mMapWanted;
+    PassResult mResult;
+    StatusList mRgOpen;  // what could not be taken away
+    PassGuard mGuard;
+};
+
+}  // namespace tavo
