@@ -21,13 +21,31 @@ namespace {
 constexpr auto kAnswerLimit = std::chrono::milliseconds(7750);
 constexpr int kLeastPollMilliseconds = 10;
 constexpr int kMostPollMilliseconds = 100;  // so that a stop is seen soon
-constexpr int kNotYet = 1000;               // no code of ours, of the library's or of the protocol's
-constexpr int kForeign = 1001;
+
+// What reading found when it found no end yet: no code of ours, of the library's or of the protocol's.
+enum Unfinished : int { kNotYet = 1 << 16, kForeign };
+
+constexpr std::pair<int, int> kCodes[] = {{0, kRouterOk},
+                                          {NATPMP_TRYAGAIN, kNotYet},
+                                          {NATPMP_ERR_UNSUPPORTEDVERSION, kNatpmpUnsupportedVersion},
+                                          {NATPMP_ERR_NOTAUTHORIZED, kNatpmpNotAuthorised},
+                                          {NATPMP_ERR_NETWORKFAILURE, kNatpmpNetworkFailure},
+                                          {NATPMP_ERR_OUTOFRESOURCES, kNatpmpOutOfResources},
+                                          {NATPMP_ERR_UNSUPPORTEDOPCODE, kNatpmpUnsupportedOpcode},
+                                          {NATPMP_ERR_NOGATEWAYSUPPORT, kRouterTimeout}};  // after its last sending
+
+constexpr std::pair<int, const char*> kWords[] = {{kRouterTimeout, "no answer from the gateway"},
+                                                  {kRouterUnreachable, "the gateway cannot be reached by NAT-PMP"},
+                                                  {kRouterGarbage, "senseless answers from the gateway"},
+                                                  {kNatpmpUnsupportedVersion, "refused: unsupported version"},
+                                                  {kNatpmpNotAuthorised, "refused: not authorised"},
+                                                  {kNatpmpNetworkFailure, "refused: network failure"},
+                                                  {kNatpmpOutOfResources, "refused: out of resources"},
+                                                  {kNatpmpUnsupportedOpcode, "refused: unsupported opcode"}};
 
 constexpr uint8_t kAnswerBit = 0x80;
 constexpr ssize_t kHeaderSize = 8;
-constexpr ssize_t kPortsSize = 12;
-constexpr ssize_t kAddressAnswerSize = 12;
+constexpr ssize_t kShortAnswerSize = 12;  // with an address, or with both ports
 constexpr ssize_t kMappingAnswerSize = 16;
 
 uint16_t Number16(const uint8_t* pBytes) {
@@ -44,9 +62,9 @@ bool IsAnswer(const uint8_t* pDatagram, ssize_t nSize, const NatpmpQuestion& que
     }
     const bool blRefusal = Number16(pDatagram + 2) != 0;
     if (question.nOpcode == 0) {
-        return blRefusal || nSize >= kAddressAnswerSize;
+        return blRefusal || nSize >= kShortAnswerSize;
     }
-    if (blRefusal && (nSize < kPortsSize || Number16(pDatagram + 8) == 0)) {
+    if (blRefusal && (nSize < kShortAnswerSize || Number16(pDatagram + 8) == 0)) {
         return true;  // some leave the port out
     }
     if (Number16(pDatagram + 8) != question.nBoxPort || (!blRefusal && nSize < kMappingAnswerSize)) {
@@ -58,53 +76,26 @@ bool IsAnswer(const uint8_t* pDatagram, ssize_t nSize, const NatpmpQuestion& que
 
 // The library's answer codes as ours.
 int CodeOf(int nLibrary, const natpmpresp_t& answer) {
-    switch (nLibrary) {
-        case 0:
-            return kRouterOk;
-        case NATPMP_TRYAGAIN:
-            return kNotYet;
-        case NATPMP_ERR_UNSUPPORTEDVERSION:
-            return kNatpmpUnsupportedVersion;
-        case NATPMP_ERR_NOTAUTHORIZED:
-            return kNatpmpNotAuthorised;
-        case NATPMP_ERR_NETWORKFAILURE:
-            return kNatpmpNetworkFailure;
-        case NATPMP_ERR_OUTOFRESOURCES:
-            return kNatpmpOutOfResources;
-        case NATPMP_ERR_UNSUPPORTEDOPCODE:
-            return kNatpmpUnsupportedOpcode;
-        case NATPMP_ERR_UNDEFINEDERROR:
-            return answer.resultcode;
-        case NATPMP_ERR_NOGATEWAYSUPPORT:  // its last transmission
-            return kRouterTimeout;
-        default:
-            return kRouterUnreachable;
+    if (nLibrary == NATPMP_ERR_UNDEFINEDERROR) {
+        return answer.resultcode;
     }
+    for (const auto& [nKnown, nCode] : kCodes) {
+        if (nKnown == nLibrary) {
+            return nCode;
+        }
+    }
+    return kRouterUnreachable;
 }
 
 }  // namespace
 
 std::string NatpmpWords(int nCode) {
-    switch (nCode) {
-        case kRouterTimeout:
-            return "no answer from the gateway";
-        case kRouterUnreachable:
-            return "the gateway cannot be reached by NAT-PMP";
-        case kRouterGarbage:
-            return "senseless answers from the gateway";
-        case kNatpmpUnsupportedVersion:
-            return "refused: unsupported version";
-        case kNatpmpNotAuthorised:
-            return "refused: not authorised";
-        case kNatpmpNetworkFailure:
-            return "refused: network failure";
-        case kNatpmpOutOfResources:
-            return "refused: out of resources";
-        case kNatpmpUnsupportedOpcode:
-            return "refused: unsupported opcode";
-        default:
-            return "refused: code " + std::to_string(nCode);
+    for (const auto& [nKnown, szWords] : kWords) {
+        if (nKnown == nCode) {
+            return szWords;
+        }
     }
+    return "refused: code " + std::to_string(nCode);
 }
 
 NatpmpClient::NatpmpClient(const std::string& szGateway, std::function<bool()> fnStop,
