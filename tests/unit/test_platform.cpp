@@ -111,7 +111,7 @@ TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
         "2>/dev/null | grep -q /tmp/t/held";
     EXPECT_NE(TLIBCSystem(szPids.c_str()), 0);
     close(fd);
-    EXPECT_EQ(TLIBCKill("testupnp.sh", SIGKILL), 1);
+    EXPECT_GE(TLIBCKill("testupnp.sh", SIGKILL), 1);  // 2 where it has just forked and not yet become sleep
     for (int i = 0; i < 500 && TLIBCIsProcAlive("testupnp.sh") == 1; ++i) {
         usleep(10000);
     }
