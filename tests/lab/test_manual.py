@@ -132,6 +132,19 @@ class Manual(unittest.TestCase):
                 self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
                 LAB.stop_router()
 
+    def test_a_failed_removal_is_made_up_for(self):
+        LAB.start_web("blind", "first_delete_fails")
+        self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+        LAB.save("1,1,tcp,5001,5001")
+        self.assertIn("removal of 5001/tcp (", events())
+        os.unlink(EVENTS)
+        self.saved({})
+
+    def test_a_router_that_falls_silent_is_left_alone(self):
+        LAB.start_web("form", "hangs_on_add")
+        LAB.save(*(f"{port},1,tcp,{port},{port}" for port in range(5001, 5021)), seconds=25)
+        self.assertIn("5020/tcp (the router has stopped answering)", events())
+
     def test_killed_in_the_middle_forgets_nothing(self):
         LAB.start_web("blind", "hangs_after_add")
         LAB.write("/etc/portforward/rule.conf",

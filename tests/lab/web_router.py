@@ -162,6 +162,8 @@ class Page(http.server.BaseHTTPRequestHandler):
             done = add(**query)
         else:
             left = [r for r in TABLE if (r["protocol"], str(r["first"])) != (query["protocol"], query["first"])]
+            if FAULT == "first_delete_fails" and COUNT[path] == 1:
+                return self.answer("busy", 500)
             done = len(left) < len(TABLE)
             TABLE[:] = left
         program()
@@ -180,7 +182,9 @@ class Server(http.server.ThreadingHTTPServer):
 
 server = Server(("", PORT), Page)
 if len(sys.argv) > 4:
-    context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
+    context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)  # as old as many a router's
+    context.set_ciphers("DEFAULT:@SECLEVEL=0")
+    context.minimum_version = context.maximum_version = ssl.TLSVersion.TLSv1
     context.load_cert_chain(sys.argv[4])
     server.socket = context.wrap_socket(server.socket, server_side=True)
 server.serve_forever()

@@ -191,7 +191,9 @@ void Forwarder::AddMissing(const std::vector<Job>& rgWanted) {
 }
 
 void Forwarder::Add(const Job& job) {
-    // Without a record a router that shows no names could not be cleared of it again.
+    // Without a record a router that shows no names could not be cleared of it again. One that was on record
+    // before stays so whatever the router says: its deletion may have failed.
+    const bool blKnown = mMade.Holds(job, "");
     if (!mMade.Add(job)) {
         Refuse(job.Text(), "the record of what was made cannot be written");
         return;
@@ -202,7 +204,7 @@ void Forwarder::Add(const Job& job) {
         return;
     }
     Refuse(job.Text(), result.szWhy);
-    if (result.blAnswered) {
+    if (result.blAnswered && !blKnown) {
         mMade.Remove(job);
     }
 }

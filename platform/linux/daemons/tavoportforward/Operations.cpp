@@ -180,6 +180,9 @@ bool ReadStep(Operations& operations, const TAVO_PF_CONF* pSection, std::string&
         szWhy = "[" + operation.szStep + "] has no path, or is one section too many";
         return false;
     }
+    if (!operation.szBody && (operation.szMethod == "POST" || operation.szMethod == "PUT")) {
+        operation.szBody = "";  // without a length some servers wait for more
+    }
     operations.rgOperations.push_back(std::move(operation));
     return true;
 }

@@ -8,6 +8,7 @@ namespace tavo {
 namespace {
 
 constexpr size_t kMaxEntries = 1024;
+constexpr int kSilentLimit = 2;
 constexpr long kUnauthorised = 401;
 constexpr long kForbidden = 403;
 
@@ -74,7 +75,11 @@ bool Session::PerformOne(const Operation& operation, const Values& values, StepR
         return Fail(result, "step \"" + operation.szStep + "\": nothing stands for {" + szMissing + "}");
     }
     request.szPath = std::move(*szPath);
+    if (mNSilent >= kSilentLimit) {
+        return Fail(result, "the router has stopped answering");
+    }
     const WebAnswer answer = mClient.Send(request);
+    mNSilent = answer.enEnd == WebEnd::kAnswered ? 0 : mNSilent + 1;
     if (answer.enEnd != WebEnd::kAnswered) {
         result.blAnswered = answer.enEnd == WebEnd::kUnreachable;
         return Fail(result, std::string(EndText(answer.enEnd)) + " (step \"" + operation.szStep + "\")");

@@ -1,6 +1,6 @@
 // Performs the steps of an operations file against the router. Relies on WebClient and Operations.
 // Promises: a step is done only when every request of it answered as the file says; the reason why it was
-// not is a text for the user, without the password in it.
+// not is a text for the user, without the password in it; a router that has fallen silent is asked no more.
 #pragma once
 
 #include <string>
@@ -34,7 +34,8 @@ private:
 
     WebClient& mClient;
     const Operations& mOperations;
-    Values mValues;  // account, addresses, and what earlier answers gave
+    int mNSilent = 0;  // requests in a row without an answer
+    Values mValues;    // account, addresses, and what earlier answers gave
 };
 
 }  // namespace tavo

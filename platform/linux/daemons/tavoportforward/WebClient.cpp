@@ -100,6 +100,9 @@ WebAnswer WebClient::Send(const WebRequest& request) {
         curl_easy_setopt(pCurl, CURLOPT_USERNAME, mRouter.szUser.c_str());
         curl_easy_setopt(pCurl, CURLOPT_PASSWORD, mRouter.szPass.c_str());
     }
+    // Many a router's TLS is as old as the router.
+    curl_easy_setopt(pCurl, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_0));
+    curl_easy_setopt(pCurl, CURLOPT_SSL_CIPHER_LIST, "DEFAULT:@SECLEVEL=0");
     if (request.szBody) {
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(request.szBody->size()));
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDS, request.szBody->c_str());

@@ -64,8 +64,11 @@ struct KnownRouter {
 
 int NotTried(const std::string& szWhy) {
     syslog(LOG_ERR, "nothing was tried: %s", szWhy.c_str());
-    TAVOLogSet1(kSystemEvents, kErrorLevel, TAVO_EVENT_PF_ADD_FAILED, "all", ("(" + szWhy + ")").c_str(), nullptr,
-                nullptr);
+    const ConfList pRules(TAVOPFRuleGet());
+    if (!pRules || TLIBPFCountRuleConf(pRules.get(), 1) != 0) {  // else there was nothing to try either
+        TAVOLogSet1(kSystemEvents, kErrorLevel, TAVO_EVENT_PF_ADD_FAILED, "all", ("(" + szWhy + ")").c_str(), nullptr,
+                    nullptr);
+    }
     return kNotTried;
 }
 
