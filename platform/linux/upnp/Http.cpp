@@ -7,7 +7,8 @@
 
 #include <algorithm>
 #include <charconv>
-#include <new>
+
+#include "upnp/HeaderList.h"
 
 namespace tavo {
 
@@ -15,11 +16,6 @@ namespace {
 
 constexpr long kConnectMilliseconds = 3000;
 constexpr size_t kMaxBody = 256U << 10U;
-
-struct ListFree {
-    void operator()(curl_slist* pList) const { curl_slist_free_all(pList); }
-};
-using HeaderList = std::unique_ptr<curl_slist, ListFree>;
 
 // Refusing a byte makes libcurl end the transfer.
 size_t TakeBody(char* pData, size_t nSize, size_t nCount, void* pUser) {
@@ -65,19 +61,6 @@ std::string UrlPart(CURLU* pUrl, CURLUPart enPart) {
     std::string szText = szPart;
     curl_free(szPart);
     return szText;
-}
-
-HeaderList MakeHeaders(const std::vector<std::string>& rgszHeaders) {
-    HeaderList pHeaders;
-    for (const std::string& szHeader : rgszHeaders) {
-        curl_slist* pGrown = curl_slist_append(pHeaders.get(), szHeader.c_str());
-        if (pGrown == nullptr) {
-            throw std::bad_alloc();
-        }
-        static_cast<void>(pHeaders.release());
-        pHeaders.reset(pGrown);
-    }
-    return pHeaders;
 }
 
 }  // namespace

@@ -7,6 +7,8 @@
 #include <algorithm>
 #include <new>
 
+#include "upnp/HeaderList.h"
+
 namespace tavo {
 
 namespace {
@@ -19,7 +21,6 @@ constexpr size_t kMaxPage = 512U << 10U;
 
 struct CurlFree {
     void operator()(CURL* pCurl) const { curl_easy_cleanup(pCurl); }
-    void operator()(curl_slist* pList) const { curl_slist_free_all(pList); }
 };
 
 // Taking fewer bytes than were offered ends the transfer.
@@ -53,8 +54,34 @@ struct WebClient::Impl {
     std::unique_ptr<CURL, CurlFree> pCurl{curl_easy_init()};
 };
 
+// What holds for every request. Set once: libcurl's reset would also lose what belongs to the cookies.
 WebClient::WebClient(WebRouter router, std::chrono::steady_clock::time_point end)
-    : mRouter(std::move(router)), mEnd(end), mPImpl(std::make_unique<Impl>()) {}
+    : mRouter(std::move(router)), mEnd(end), mPImpl(std::make_unique<Impl>()) {
+    CURL* pCurl = mPImpl->pCurl.get();
+    if (pCurl == nullptr) {
+        throw std::bad_alloc();
+    }
+    curl_easy_setopt(pCurl, CURLOPT_PATH_AS_IS, 1L);
+    curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, mRouter.szScheme.c_str());
+    curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
+    curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);
+    curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(pCurl, CURLOPT_COOKIEFILE, "");  // no file: cookies in memory
+    // A home router signs its own certificate, for a name or an address that is not the one it has here,
+    // and makes a new one when it is reset: there is nothing to check it against. TLS then keeps the
+    // password from those who only listen; against one who answers in the gateway's place it does not
+    // help, and such a one has all of the box's traffic anyway. Many a router's TLS is as old as the router.
+    curl_easy_setopt(pCurl, CURLOPT_SSL_VERIFYPEER, 0L);
+    curl_easy_setopt(pCurl, CURLOPT_SSL_VERIFYHOST, 0L);
+    curl_easy_setopt(pCurl, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_0));
+    curl_easy_setopt(pCurl, CURLOPT_SSL_CIPHER_LIST, "DEFAULT:@SECLEVEL=0");
+    curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakePage);
+    if (mRouter.enAuth != WebAuth::kNone) {
+        curl_easy_setopt(pCurl, CURLOPT_HTTPAUTH, CurlAuth(mRouter.enAuth));
+        curl_easy_setopt(pCurl, CURLOPT_USERNAME, mRouter.szUser.c_str());
+        curl_easy_setopt(pCurl, CURLOPT_PASSWORD, mRouter.szPass.c_str());
+    }
+}
 
 WebClient::~WebClient() = default;
 
@@ -62,50 +89,23 @@ WebAnswer WebClient::Send(const WebRequest& request) {
     WebAnswer answer;
     CURL* pCurl = mPImpl->pCurl.get();
     const auto left = std::chrono::duration_cast<milliseconds>(mEnd - std::chrono::steady_clock::now());
-    if (pCurl == nullptr || left <= milliseconds(0)) {
+    if (left <= milliseconds(0)) {
         answer.enEnd = WebEnd::kTimeout;
         return answer;
     }
-    std::unique_ptr<curl_slist, CurlFree> pHeaders;
-    for (const std::string& szHeader : request.rgszHeaders) {
-        curl_slist* pGrown = curl_slist_append(pHeaders.get(), szHeader.c_str());
-        if (pGrown == nullptr) {
-            throw std::bad_alloc();
-        }
-        static_cast<void>(pHeaders.release());
-        pHeaders.reset(pGrown);
-    }
+    const HeaderList pHeaders = MakeHeaders(request.rgszHeaders);
     const std::string szUrl = mRouter.Url() + request.szPath;
-    curl_easy_reset(pCurl);  // keeps cookies and the open connection
     curl_easy_setopt(pCurl, CURLOPT_URL, szUrl.c_str());
-    curl_easy_setopt(pCurl, CURLOPT_PATH_AS_IS, 1L);
-    curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, mRouter.szScheme.c_str());
-    curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
-    curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);
-    curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(pCurl, CURLOPT_COOKIEFILE, "");  // no file: cookies in memory
     curl_easy_setopt(pCurl, CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(std::min(left, kConnectLimit).count()));
     curl_easy_setopt(pCurl, CURLOPT_TIMEOUT_MS, static_cast<long>(std::min(left, kRequestLimit).count()));
-    // A home router signs its own certificate, for a name or an address that is not the one it has here,
-    // and makes a new one when it is reset: there is nothing to check it against. TLS then keeps the
-    // password from those who only listen; against one who answers in the gateway's place it does not
-    // help, and such a one has all of the box's traffic anyway.
-    curl_easy_setopt(pCurl, CURLOPT_SSL_VERIFYPEER, 0L);
-    curl_easy_setopt(pCurl, CURLOPT_SSL_VERIFYHOST, 0L);
     curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
-    curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakePage);
     curl_easy_setopt(pCurl, CURLOPT_WRITEDATA, &answer.szBody);
-    if (mRouter.enAuth != WebAuth::kNone) {
-        curl_easy_setopt(pCurl, CURLOPT_HTTPAUTH, CurlAuth(mRouter.enAuth));
-        curl_easy_setopt(pCurl, CURLOPT_USERNAME, mRouter.szUser.c_str());
-        curl_easy_setopt(pCurl, CURLOPT_PASSWORD, mRouter.szPass.c_str());
-    }
-    // Many a router's TLS is as old as the router.
-    curl_easy_setopt(pCurl, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_0));
-    curl_easy_setopt(pCurl, CURLOPT_SSL_CIPHER_LIST, "DEFAULT:@SECLEVEL=0");
     if (request.szBody) {
+        curl_easy_setopt(pCurl, CURLOPT_POST, 1L);
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(request.szBody->size()));
         curl_easy_setopt(pCurl, CURLOPT_POSTFIELDS, request.szBody->c_str());
+    } else {
+        curl_easy_setopt(pCurl, CURLOPT_HTTPGET, 1L);
     }
     curl_easy_setopt(pCurl, CURLOPT_CUSTOMREQUEST, request.szMethod.c_str());
     answer.enEnd = EndOf(curl_easy_perform(pCurl));
