@@ -52,6 +52,43 @@ TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
     }
 }
 
+TEST(SectionedFile, NamesAreNeverMergedNorCut) {
+    const std::string szLong(2000, 'x');
+    Write(kPath, "[a]\nk=1\n[a]\nk=2\nother=3\n[" + szLong + "1]\nk=4\n[" + szLong + "2]\nk=5\n");
+    char szValue[8] = "kept";
+    TLIBCSzHash* pHash = TLIBCSzHashAlloc(0);
+    TLIBCSzHashSetValue(pHash, "k", "old");
+    gLog.clear();
+    EXPECT_EQ(TLIBCFileGetSection(kPath, "absent", pHash), 0);
+    EXPECT_EQ(TLIBCFileGetSection(kPath, "a", pHash), 1);
+    EXPECT_STREQ(TLIBCSzHashGetValue(pHash, "k"), "1");
+    EXPECT_EQ(TLIBCSzHashCount(pHash), 1);
+    EXPECT_EQ(gLog, std::vector<std::string>{"more than one section [a]; the first counts"});
+    EXPECT_LT(TLIBCFileGetSectionValue(kPath, "a", "other", szValue, sizeof(szValue)), 0);
+    EXPECT_EQ(TLIBCFileAddSection(kPath, "a", pHash, 0), 1);
+    EXPECT_EQ(tavo::ParseSections(Read(kPath))->size(), 4U);
+    EXPECT_EQ(TLIBCFileGetSectionValue(kPath, (szLong + "2").c_str(), "k", szValue, sizeof(szValue)), 0);
+    EXPECT_STREQ(szValue, "5");
+    TLIBCSzHashFree(pHash);
+
+    std::string szMany;
+    for (int i = 0; i < 20000; ++i) {
+        szMany += "[]\n";
+    }
+    const std::string rgszRefused[] = {"[1]\nk=1\n[" + std::string(1024, 'x') + "]\nk=2\n", szMany,
+                                       std::string("[1]\nk=\0\n", 9)};
+    for (const std::string& szText : rgszRefused) {
+        Write("/etc/portforward/rule.conf", szText);
+        EXPECT_EQ(TAVOPFRuleGet(), nullptr);
+        EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_FORMAT);
+        EXPECT_EQ(Read("/etc/portforward/rule.conf"), szText);
+    }
+    EXPECT_TRUE(Logged("line 2: neither a section nor a key; the file is left alone and not used"));
+    std::filesystem::remove("/etc/portforward/rule.conf");
+    EXPECT_EQ(TAVOPFRuleGet(), nullptr);
+    EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_NOT_FOUND);
+}
+
 TEST(KeyFile, ChangesOneLineAndCanBeSourced) {
     Write(kPath, "# kept\na=\"1\"\n  odd line\nb='2'\n");
     EXPECT_EQ(TLIBCFileSetKeyValue(kPath, "a", "x\"$(id)`id`\\", "%s=\"%s\"\n"), 1);
@@ -118,6 +155,23 @@ TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
     EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
     EXPECT_EQ(TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr), -1);
     EXPECT_EQ(TLIBCSystem("exit 3"), 3);
+}
+
+TEST(Process, StartsAreReportedTrulyInOddCallers) {
+    int rgFdKept[2] = {dup(0), dup(1)};
+    close(0);
+    close(1);  // the pipe that reports a failed start gets these two
+    const int nAbsent = TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr);
+    dup2(rgFdKept[0], 0);
+    dup2(rgFdKept[1], 1);
+    close(rgFdKept[0]);
+    close(rgFdKept[1]);
+    EXPECT_EQ(nAbsent, -1);
+    signal(SIGCHLD, SIG_IGN);  // as many a daemon does: no status of a child is kept
+    EXPECT_EQ(TLIBCExec("/bin/true", nullptr, nullptr, nullptr, nullptr), 0);
+    EXPECT_EQ(TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr), -1);
+    EXPECT_EQ(TLIBCSystem("true"), 255);
+    signal(SIGCHLD, SIG_DFL);
 }
 
 TEST(Rules, AreTakenApartPairByPair) {

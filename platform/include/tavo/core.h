@@ -82,8 +82,9 @@ int TLIBCFileExist(const char* szPath);
 /* Creates an empty file, or updates the times of one that is there. 0: done; -1: failed. */
 int TLIBCFileTouch(const char* szPath);
 
-/* Reads the pairs of one section into pHash. Number of keys read; 0: the section is absent or empty;
- * negative: the file cannot be read or parsed. */
+/* Reads the pairs of one section into pHash. Number of pairs read; 0: the section is absent or empty;
+ * negative: the file cannot be read or parsed. Of two sections with one name the first counts, which is
+ * logged; of two pairs with one key the last. */
 int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* pHash);
 /* Writes the section at the end of the file, which is created 0600 when missing; a section of that
  * name is replaced where it stands. nFlags: reserved, 0. 1: written; negative: failed. */
@@ -121,7 +122,8 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
  * negative with errno set: no process could be made. */
 pid_t TLIBCProcFork(void);
 /* Runs a command through /bin/sh with no descriptor above standard error and waits. Its exit status
- * (128 + signal when it was killed); -1: the shell could not be started, or a null command. */
+ * (128 + signal when it was killed; 255 when it is lost because the caller ignores SIGCHLD); -1: the shell
+ * could not be started, or a null command. */
 int TLIBCSystem(const char* szCommand);
 
 /* ---- services --------------------------------------------------------------------------------- */

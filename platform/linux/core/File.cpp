@@ -6,8 +6,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <memory>
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
@@ -27,11 +30,6 @@ int Fail(int nErr, int nLine) {
     return -1;
 }
 
-std::optional<std::vector<tavo::Section>> LoadSections(const char* szPath) {
-    const std::optional<std::string> szText = tavo::ReadFile(szPath);
-    return szText ? tavo::ParseSections(*szText) : std::nullopt;
-}
-
 void CopyOut(const std::string& szText, char* szValue, int nSize) {
     std::snprintf(szValue, static_cast<size_t>(nSize), "%s", szText.c_str());
 }
@@ -44,7 +42,7 @@ public:
         const std::string szDir = nSlash == std::string::npos ? "." : szPath.substr(0, nSlash + 1);
         mFd.Reset(open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         // Held only for the moment of a replacement; a holder that hangs must not hang everybody.
-        for (int i = 0; mFd.Get() >= 0 && i < kTries && flock(mFd.Get(), LOCK_EX | LOCK_NB) != 0; ++i) {
+        for (int i = 0; i < kTries && flock(mFd.Get(), LOCK_EX | LOCK_NB) != 0 && errno == EWOULDBLOCK; ++i) {
             usleep(kTryMicroseconds);
         }
     }
@@ -79,7 +77,8 @@ bool IsKeyFormat(std::string_view szFormat) {
 }
 
 bool IsPlainKey(std::string_view szKey) {
-    return !szKey.empty() && szKey.find_first_of("=\"\\#[]\n\r") == std::string_view::npos;
+    return !szKey.empty() && tavo::Trim(szKey) == szKey &&
+           szKey.find_first_of("=\"\\#[]\n\r") == std::string_view::npos;
 }
 
 // The text with the key's line replaced, or added at the end.
@@ -135,21 +134,20 @@ int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* 
         if (szPath == nullptr || szSection == nullptr || pHash == nullptr) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        const auto rgSections = LoadSections(szPath);
+        const auto rgSections = tavo::LoadSections(szPath);
         if (!rgSections) {
             return -1;
         }
-        for (const tavo::Section& section : *rgSections) {
-            if (section.szName != szSection) {
-                continue;
-            }
-            for (const tavo::Pair& pair : section.rgPairs) {
-                if (TLIBCSzHashSetValue(pHash, pair.szKey.c_str(), pair.szValue.c_str()) < 0) {
-                    return -1;
-                }
+        const tavo::Section* pSection = tavo::FindSection(*rgSections, szSection, szPath);
+        if (pSection == nullptr) {
+            return 0;
+        }
+        for (const tavo::Pair& pair : pSection->rgPairs) {
+            if (TLIBCSzHashSetValue(pHash, pair.szKey.c_str(), pair.szValue.c_str()) < 0) {
+                return -1;
             }
         }
-        return TLIBCSzHashCount(pHash);
+        return static_cast<int>(pSection->rgPairs.size());
     });
 }
 
@@ -161,7 +159,7 @@ int TLIBCFileAddSection(const char* szPath, const char* szSection, const TLIBCSz
         const DirectoryLock lock(szPath);
         std::vector<tavo::Section> rgSections;
         if (TLIBCFileExist(szPath) == 1) {
-            auto rgOld = LoadSections(szPath);
+            auto rgOld = tavo::LoadSections(szPath);
             if (!rgOld) {
                 return -1;
             }
@@ -192,22 +190,21 @@ int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const ch
         if (szPath == nullptr || szSection == nullptr || szKey == nullptr || szValue == nullptr || nSize < 1) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        const auto rgSections = LoadSections(szPath);
+        const auto rgSections = tavo::LoadSections(szPath);
         if (!rgSections) {
             return -1;
         }
-        const std::string* pFound = nullptr;
-        for (const tavo::Section& section : *rgSections) {
-            for (const tavo::Pair& pair : section.rgPairs) {
-                if (section.szName == szSection && pair.szKey == szKey) {
-                    pFound = &pair.szValue;
-                }
-            }
-        }
-        if (pFound == nullptr) {
+        const tavo::Section* pSection = tavo::FindSection(*rgSections, szSection, szPath);
+        if (pSection == nullptr) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
-        CopyOut(*pFound, szValue, nSize);
+        // The last of two pairs with one key counts, as in a hash.
+        const auto it = std::find_if(pSection->rgPairs.rbegin(), pSection->rgPairs.rend(),
+                                     [szKey](const tavo::Pair& pair) { return pair.szKey == szKey; });
+        if (it == pSection->rgPairs.rend()) {
+            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        }
+        CopyOut(it->szValue, szValue, nSize);
         return 0;
     });
 }
@@ -265,9 +262,9 @@ int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppH
         if (!szText) {
             return -1;
         }
-        if (*ppHash == nullptr) {
-            *ppHash = TLIBCSzHashAlloc(0);
-        }
+        std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pNew(
+            *ppHash == nullptr ? TLIBCSzHashAlloc(0) : nullptr, &TLIBCSzHashFree);
+        TLIBCSzHash* pHash = *ppHash == nullptr ? pNew.get() : *ppHash;
         int nPairs = 0;
         for (const std::string_view szRaw : tavo::SplitLines(*szText)) {
             const std::string_view szLine = tavo::Trim(szRaw);
@@ -284,11 +281,13 @@ int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppH
                 const auto pair = tavo::ParseKeyLine("k=" + std::string(szRest));
                 szValue = pair ? pair->szValue : std::string(tavo::Trim(szRest));
             }
-            if (TLIBCSzHashSetValue(*ppHash, szKey.c_str(), szValue ? szValue->c_str() : nullptr) < 0) {
+            if (TLIBCSzHashSetValue(pHash, szKey.c_str(), szValue ? szValue->c_str() : nullptr) < 0) {
                 return -1;
             }
             ++nPairs;
         }
+        *ppHash = pHash;
+        pNew.release();
         return nPairs;
     });
 }

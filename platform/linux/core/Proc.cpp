@@ -29,6 +29,7 @@ namespace {
 constexpr char kFile[] = "platform/linux/core/Proc.cpp";
 constexpr size_t kKernelNameSize = 15;
 constexpr int kSignalledStatus = 128;
+constexpr int kLostStatus = 255;  // the caller ignores SIGCHLD: the child has ended, nobody knows how
 
 using tavo::AtBorder;
 using tavo::Descriptor;
@@ -169,7 +170,7 @@ int WaitFor(pid_t pid) {
     int nStatus = 0;
     while (waitpid(pid, &nStatus, 0) < 0) {
         if (errno != EINTR) {
-            return -1;
+            return kLostStatus;
         }
     }
     return WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : kSignalledStatus + WTERMSIG(nStatus);

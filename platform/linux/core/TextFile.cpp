@@ -5,9 +5,10 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
-#include <climits>
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <memory>
@@ -21,6 +22,7 @@ namespace {
 
 constexpr char kFile[] = "platform/linux/core/TextFile.cpp";
 constexpr size_t kMaxFile = 16U << 20U;
+constexpr size_t kMaxLoggedName = 200;
 constexpr char kHexDigits[] = "0123456789abcdef";
 
 bool Fail(int nErr, int nLine) {
@@ -157,6 +159,29 @@ bool IsCommentOrBlank(std::string_view szLine) {
     return szLine.empty() || szLine.front() == '#';
 }
 
+// Takes in one line; false when it is neither section, pair, comment nor blank.
+bool ParseLine(std::string_view szLine, std::vector<Section>& rgSections) {
+    if (szLine.find('\0') != std::string_view::npos) {
+        return false;  // would cut the text for every C reader
+    }
+    if (IsCommentOrBlank(szLine)) {
+        return true;
+    }
+    if (szLine.front() == '[' && szLine.back() == ']') {
+        std::optional<std::string> szName = Unescape(szLine.substr(1, szLine.size() - 2));
+        if (szName) {
+            rgSections.push_back({std::move(*szName), {}});
+        }
+        return szName.has_value();
+    }
+    std::optional<Pair> pair = ParsePair(szLine);
+    if (!pair || rgSections.empty()) {
+        return false;
+    }
+    rgSections.back().rgPairs.push_back(std::move(*pair));
+    return true;
+}
+
 bool WriteAll(int fd, std::string_view szText) {
     while (!szText.empty()) {
         const ssize_t nWritten = write(fd, szText.data(), szText.size());
@@ -239,7 +264,11 @@ bool KeepOwnerAndMode(int fd, const std::string& szTarget, mode_t nNewMode) {
 std::optional<std::string> ReadFile(const std::string& szPath) {
     const Descriptor fd(open(szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
     struct stat status = {};
-    if (fd.Get() < 0 || fstat(fd.Get(), &status) != 0 || !S_ISREG(status.st_mode)) {
+    if (fd.Get() < 0) {
+        Fail(errno == ENOENT ? TLIBC_ERR_NOT_FOUND : TLIBC_ERR_OPEN, __LINE__);
+        return std::nullopt;
+    }
+    if (fstat(fd.Get(), &status) != 0 || !S_ISREG(status.st_mode)) {
         Fail(TLIBC_ERR_OPEN, __LINE__);
         return std::nullopt;
     }
@@ -301,31 +330,50 @@ std::vector<std::string_view> SplitLines(std::string_view szText) {
     return rgLines;
 }
 
-std::optional<std::vector<Section>> ParseSections(std::string_view szText) {
+std::optional<std::vector<Section>> ParseSections(std::string_view szText, size_t* pnBadLine) {
     std::vector<Section> rgSections;
-    if (szText.find('\0') != std::string_view::npos) {
-        Fail(TLIBC_ERR_FORMAT, __LINE__);
-        return std::nullopt;
-    }
-    for (const std::string_view szRaw : SplitLines(szText)) {
-        const std::string_view szLine = Trim(szRaw);
-        if (IsCommentOrBlank(szLine)) {
-            continue;
-        }
-        if (szLine.front() == '[' && szLine.back() == ']') {
-            std::optional<std::string> szName = Unescape(szLine.substr(1, szLine.size() - 2));
-            if (szName) {
-                rgSections.push_back({std::move(*szName), {}});
-                continue;
+    size_t nLine = 0;
+    for (const std::string_view szLine : SplitLines(szText)) {
+        ++nLine;
+        if (!ParseLine(Trim(szLine), rgSections)) {
+            Fail(TLIBC_ERR_FORMAT, __LINE__);
+            if (pnBadLine != nullptr) {
+                *pnBadLine = nLine;
             }
-        } else if (std::optional<Pair> pair = ParsePair(szLine); pair && !rgSections.empty()) {
-            rgSections.back().rgPairs.push_back(std::move(*pair));
-            continue;
+            return std::nullopt;
         }
-        Fail(TLIBC_ERR_FORMAT, __LINE__);
-        return std::nullopt;
     }
     return rgSections;
+}
+
+std::optional<std::vector<Section>> LoadSections(const std::string& szPath) {
+    const std::optional<std::string> szText = ReadFile(szPath);
+    if (!szText) {
+        return std::nullopt;
+    }
+    size_t nBadLine = 0;
+    std::optional<std::vector<Section>> rgSections = ParseSections(*szText, &nBadLine);
+    if (!rgSections) {
+        syslog(LOG_ERR, "%s, line %zu: neither a section nor a key; the file is left alone and not used",
+               szPath.c_str(), nBadLine);
+    }
+    return rgSections;
+}
+
+const Section* FindSection(const std::vector<Section>& rgSections, std::string_view szName, const char* szPath) {
+    const Section* pFound = nullptr;
+    for (const Section& section : rgSections) {
+        if (section.szName != szName) {
+            continue;
+        }
+        if (pFound != nullptr) {
+            syslog(LOG_WARNING, "%s: more than one section [%s]; the first counts", szPath,
+                   PrintableText(szName, kMaxLoggedName).c_str());
+            break;
+        }
+        pFound = &section;
+    }
+    return pFound;
 }
 
 std::string FormatSections(const std::vector<Section>& rgSections) {

@@ -27,8 +27,8 @@ struct Section {
     std::vector<Pair> rgPairs;
 };
 
-// The whole file. Nothing, with the last error set, when it is missing, unreadable, no regular file or
-// larger than 16 MiB.
+// The whole file. Nothing, with the last error set, when it is missing (TLIBC_ERR_NOT_FOUND), unreadable,
+// no regular file or larger than 16 MiB.
 TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath);
 
 // Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
@@ -36,8 +36,14 @@ TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath)
 TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_view szText,
                                        mode_t nNewMode = kPrivateMode);
 
-// All sections in file order. Nothing when any line is neither section, pair, comment nor blank.
-TAVO_PLATFORM_API std::optional<std::vector<Section>> ParseSections(std::string_view szText);
+// All sections in file order; two of one name stay two. Nothing when any line is neither section, pair,
+// comment nor blank; pnBadLine, where given, is its number.
+TAVO_PLATFORM_API std::optional<std::vector<Section>> ParseSections(std::string_view szText,
+                                                                    size_t* pnBadLine = nullptr);
+// The same for a file; the line that spoils it is logged.
+std::optional<std::vector<Section>> LoadSections(const std::string& szPath);
+// The first section of that name, or null; that there is another one in szPath is logged.
+const Section* FindSection(const std::vector<Section>& rgSections, std::string_view szName, const char* szPath);
 TAVO_PLATFORM_API std::string FormatSections(const std::vector<Section>& rgSections);
 
 // One line of a key file as key and value; nothing for blank lines, comments and what is neither.
