@@ -215,7 +215,8 @@ TAVO_API int TLibFreeRulesArr(__tag_TAVO_ROUTER_RULE* pRules);
 /* Takes the router lock for this process, without waiting. 0: taken; -1: held elsewhere. While it is
  * held, call the other functions with blLock false. */
 TAVO_API int TLibTavoPortMapLock(void);
-/* Gives it back; one unlock for one lock. Always 0. */
+/* Gives it back; one unlock for one lock (a further one closes that descriptor number again, whatever it
+ * is by then). Always 0. */
 TAVO_API int TLibTavoPortMapUnLock(void);
 /* What is running now, in any process. -1: null pointer. */
 TAVO_API int TLibGetLibTavoPortMapRunningTask(__tag_TAVO_LIBTAVOPORTMAP_TASK* pEnTask);

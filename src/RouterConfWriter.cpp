@@ -78,6 +78,7 @@ int RouterConfWriter::ReloadOldSection(const std::string& gatewayIP) {
         return 0;
     }
     if (!EnsureHash(pSection)) {
+        LogError("%s:%d hash malloc failed", kFile, __LINE__);
         return 0;
     }
     TAVOPFConfFree(mPHead);

@@ -7,6 +7,7 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -167,6 +168,19 @@ private:
 void RenameLogged(const char* szFrom, const char* szTo, int nLine) {
     if (rename(szFrom, szTo) != 0) {
         LogError("%s:%d rename(%s, %s) failed ", kFile, nLine, szFrom, szTo);
+    }
+}
+
+// The new file is made afresh; whoever may read the old one may read it too.
+void KeepOwnerAndMode(const char* szOld, const char* szNew) {
+    struct stat status = {};
+    struct stat own = {};
+    if (stat(szOld, &status) != 0 || stat(szNew, &own) != 0) {
+        return;
+    }
+    const bool blSameOwner = own.st_uid == status.st_uid && own.st_gid == status.st_gid;
+    if (blSameOwner || chown(szNew, status.st_uid, status.st_gid) == 0) {
+        chmod(szNew, status.st_mode & 07777U);
     }
 }
 
@@ -388,6 +402,7 @@ bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
     }
     if (TLIBCFileExist(szAside.c_str()) == 1) {
         if (blWritten) {
+            KeepOwnerAndMode(szAside.c_str(), szPath);
             unlink(szAside.c_str());
         } else {
             RenameLogged(szAside.c_str(), szPath, __LINE__);

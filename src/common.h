@@ -134,8 +134,8 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
 std::string UniqueName(const char* szPath);
 
 // Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new
-// one, and the old one is deleted after success and renamed back after failure. True when fnWrite
-// succeeded; every failure is logged.
+// one, and the old one is deleted after success (the new one takes its owner and mode) and renamed back
+// after failure. True when fnWrite succeeded; every failure is logged, and what fnWrite throws is one.
 bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite);
 
 // What distinguishes one port-mapping daemon from the other.

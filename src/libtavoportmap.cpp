@@ -93,7 +93,13 @@ int TLibFreeRulesArr(__tag_TAVO_ROUTER_RULE* pRules) {
 }
 
 int TLibTavoPortMapLock() {
-    return lock_file(kRouterLock, gFdRouterLock) != 0 ? 0 : -1;
+    if (lock_file(kRouterLock, gFdRouterLock) != 0) {
+        return 0;
+    }
+    // Held elsewhere: a caller that tries again and again must not run out of descriptors.
+    unlock_file(gFdRouterLock);
+    gFdRouterLock = -1;
+    return -1;
 }
 
 int TLibTavoPortMapUnLock() {
@@ -147,6 +153,20 @@ int TLibGetGatewayIP(char* szOutGatewayIP, int nSize) {
 
 // ---- rule arrays ------------------------------------------------------------------------------------
 
+namespace {
+
+// Whether the rule file is there. A writer that was killed may have left the rules aside only: the first
+// reader brings them back, and "no rules" must not be said before one has looked.
+bool IsRuleFileThere(const char* szPath, bool blRuleConf) {
+    if (TLIBCFileExist(szPath) == 1) {
+        return true;
+    }
+    const tavo::lib::ConfList pList(blRuleConf ? TAVOPFRuleGet() : TAVOPFTestRuleGet());
+    return pList != nullptr || TLIBCFileExist(szPath) == 1;
+}
+
+}  // namespace
+
 int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool blRuleConf, char* szIdList,
                             bool blLock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
     const char* szPath = blRuleConf ? tavo::lib::kRuleConf : tavo::lib::kTestRuleConf;
@@ -166,7 +186,7 @@ int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool
         return -1;
     }
     struct stat status = {};
-    const bool blExist = TLIBCFileExist(szPath) == 1;
+    const bool blExist = IsRuleFileThere(szPath, blRuleConf);
     if (blExist && stat(szPath, &status) != 0) {
         LogError("%s:%d stat(%s) failed", kFile, __LINE__, szPath);
         return -1;

@@ -98,6 +98,57 @@ TEST_F(Library, RuleArrays) {
     EXPECT_TRUE(Logged("get rule router port failed"));
 }
 
+TEST_F(Library, RuleFilesThatCannotBeConverted) {
+    const std::string szPorts = "s_port=1\nr_port=2\n";
+    const struct {
+        std::string szText;
+        int nRules;  // on failure the count keeps the number of sections
+        std::vector<std::string> rgszLines;
+    } rgCases[] = {
+        {"[1]\n" + szPorts + "protocol name=tcp\n", 1, {"get rule enable failed", "IsRuleEnable() failed"}},
+        {"[1]\n[2]\n[3]\n", 3, {"section shall not be empty", "IsRuleEnable() failed"}},
+        {"[1]\nenabled=1\nr_port=2\n", 1, {"get rule src port failed", "GetRulePort() failed"}},
+        {"[1]\nenabled=1\ns_port=2\n", 1, {"get rule router port failed", "GetRulePort() failed"}},
+        {"[1]\nenabled=1\n" + szPorts, 1, {"get protocol failed", "GetRuleProtocol() failed"}},
+        {"# nothing\n", 7, {"TAVOPFRuleGetByIdList() failed"}},
+    };
+    for (const auto& broken : rgCases) {
+        Write(kRuleConf, broken.szText);
+        std::vector<std::string> rgszLines = broken.rgszLines;
+        if (rgszLines.size() > 1) {
+            rgszLines.push_back("PF_CONF::ToArray() failed");
+        }
+        int nRules = 7;
+        Rule* pRules = nullptr;
+        gLog.clear();
+        EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr), -1);
+        EXPECT_EQ(gLog, rgszLines);
+        EXPECT_EQ(nRules, broken.nRules) << broken.szText;
+        EXPECT_EQ(pRules, nullptr);
+    }
+    auto enErr = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
+    gLog.clear();
+    EXPECT_EQ(TLibGetRulesArrFromTestRuleConf(nullptr, nullptr, nullptr, true, &enErr), -1);
+    EXPECT_EQ(gLog, std::vector<std::string>{"ppRgRules is NULL"});
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
+}
+
+TEST_F(Library, ALockHeldElsewhereCostsNoDescriptors) {
+    const auto fnOpen = [] { return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}); };
+    int fd = -1;
+    ASSERT_EQ(lock_file("/tmp/routerconf.lock", fd), 1);
+    const auto nOpen = fnOpen();
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(TLibTavoPortMapLock(), -1);
+    }
+    EXPECT_EQ(fnOpen(), nOpen);
+    EXPECT_EQ(TLibTavoPortMapUnLock(), 0);
+    EXPECT_EQ(fnOpen(), nOpen);
+    unlock_file(fd);
+    EXPECT_EQ(TLibTavoPortMapLock(), 0);
+    EXPECT_EQ(TLibTavoPortMapUnLock(), 0);
+}
+
 TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
     Write(kRuleConf, "[9]\nenabled=1\n");
     for (const char* szFailing : {"whole write", "first rename"}) {
@@ -118,15 +169,6 @@ TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
         EXPECT_EQ(writer.Sync(), 1);
         EXPECT_NE(Read(kRuleConf).find("[7]\nenabled=\"1\"\ns_port=\"2\"\nr_port=\"1\"\n"), std::string::npos);
     }
-}
-
-TEST_F(Library, RulesOfAKilledWriterComeBackAndReplaceNothing) {
-    Write("/etc/portforward/rule.confaB3dE6", "[9]\nenabled=1\n");
-    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
-    EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
-    Write("/etc/portforward/rule.confaB3dE6", "[8]\nenabled=1\n");
-    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
-    EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
 }
 
 TEST_F(Library, RouterConfWriterKeepsOrDropsOtherGateways) {

@@ -31,7 +31,11 @@ typedef struct tag_TAVO_ROUTER_SCRIPT TAVO_ROUTER_SCRIPT;
 void TAVOPFConfFree(TAVO_PF_CONF* pHead);
 
 /* All sections of /etc/portforward/rule.conf (testrule.conf), in file order. NULL: no file, an empty
- * one, or one that cannot be parsed (the last error tells them apart: TLIBC_ERR_NONE for empty). */
+ * one, or one that cannot be parsed, has a section name that does not fit or more than 16384 sections
+ * (the last error tells them apart: TLIBC_ERR_NONE for empty, TLIBC_ERR_NOT_FOUND for no file).
+ * A writer moves the old file aside, to its name and six more letters and digits, before it writes the
+ * new one. Where it was killed in between, the newest such copy is put back before the file is read;
+ * copies that later writes made obsolete are deleted once they are ten minutes old. */
 TAVO_PF_CONF* TAVOPFRuleGet(void);
 TAVO_PF_CONF* TAVOPFTestRuleGet(void);
 /* The sections whose names stand in szIdList (separated by "," or blanks), in file order; NULL or an

@@ -1,18 +1,17 @@
 // Rule and router files as lists of nodes, and the counts that the capacity checks use.
 // Relies on TextFile and on the description of the router for the count of jobs.
 // Promises: a list is whole or absent; a file is replaced whole or left alone.
-#include <fcntl.h>
 #include <syslog.h>
 
+#include <algorithm>
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <filesystem>
 #include <new>
 
 #include "core/Border.h"
-#include "core/Directory.h"
+#include "portforward/Aside.h"
 #include "portforward/ConfList.h"
 #include "portforward/PortText.h"
 
@@ -23,41 +22,26 @@ constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr int kMaxPort = 65535;
-constexpr size_t kAsideSuffix = 6;
+constexpr int kLoadTries = 8;
+constexpr size_t kMaxSections = 16384;  // a node has a kilobyte: a file of nothing but "[]" must not eat it all
 
 using tavo::AtBorder;
 using tavo::ConfList;
 using tavo::Value;
 
-// A writer that was killed between moving the old file aside (its name and six more characters) and
-// writing the new one leaves neither: the newest copy comes back. It never replaces a file, so it is
-// harmless while a writer is at work.
-void RecoverAside(const char* szPath) {
-    if (TLIBCFileExist(szPath) == 1) {
-        return;
-    }
-    namespace fs = std::filesystem;
-    const fs::path path(szPath);
-    const std::string szName = path.filename();
-    std::error_code error;
-    fs::path newest;
-    const auto rgszSeen = tavo::NamesIn(path.parent_path());
-    for (const std::string& szSeen : rgszSeen ? *rgszSeen : std::vector<std::string>()) {
-        const bool blCopy = szSeen.size() == szName.size() + kAsideSuffix && szSeen.starts_with(szName);
-        const fs::path copy = path.parent_path() / szSeen;
-        if (blCopy && (newest.empty() || fs::last_write_time(newest, error) < fs::last_write_time(copy, error))) {
-            newest = copy;
-        }
-    }
-    if (!newest.empty() && renameat2(AT_FDCWD, newest.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
-        syslog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest.c_str());
-    }
-}
-
 TAVO_PF_CONF* Load(const char* szPath) {
     return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] {
-        RecoverAside(szPath);
-        return tavo::LoadConfList(szPath).release();
+        ConfList pList = tavo::LoadConfList(szPath);
+        // A writer may be moving the file aside again and again, and a single look may find neither file nor
+        // copy: "no rules" is said only when several find nothing.
+        for (int i = 1; TLIBCErrGet() == TLIBC_ERR_NOT_FOUND && i < kLoadTries; ++i) {
+            tavo::BringBack(szPath);
+            pList = tavo::LoadConfList(szPath);
+        }
+        if (TLIBCErrGet() == TLIBC_ERR_NONE) {
+            tavo::DropObsolete(szPath);
+        }
+        return pList.release();
     });
 }
 
@@ -176,16 +160,23 @@ ConfList MakeConfList(const std::vector<Section>& rgSections) {
 }
 
 ConfList LoadConfList(const char* szPath) {
-    const std::optional<std::string> szText = ReadFile(szPath);
-    if (!szText) {
-        return nullptr;
-    }
-    const std::optional<std::vector<Section>> rgSections = ParseSections(*szText);
+    const std::optional<std::vector<Section>> rgSections = LoadSections(szPath);
     if (!rgSections) {
         return nullptr;
     }
+    // A name that was cut could be taken for another one.
+    const bool blFits = rgSections->size() <= kMaxSections &&
+                        std::all_of(rgSections->begin(), rgSections->end(),
+                                    [](const Section& section) { return section.szName.size() < TAVO_PF_NAME_SIZE; });
+    if (!blFits) {
+        syslog(LOG_ERR, "%s: too many sections, or a name over %d bytes; the file is left alone and not used", szPath,
+               TAVO_PF_NAME_SIZE - 1);
+        TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
+        return nullptr;
+    }
+    ConfList pList = MakeConfList(*rgSections);
     TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
-    return MakeConfList(*rgSections);
+    return pList;
 }
 
 }  // namespace tavo

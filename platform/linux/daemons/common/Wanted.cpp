@@ -75,8 +75,7 @@ WantedSet ReadWanted(const char* szRunKey) {
         return wanted;
     }
     const ConfList pRules(TAVOPFRuleGet());
-    wanted.blReadable =
-        pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCFileExist("/etc/portforward/rule.conf") == 0;
+    wanted.blReadable = pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCErrGet() == TLIBC_ERR_NOT_FOUND;
     std::map<std::string, uint16_t> mapBoxPorts;
     for (const TAVO_PF_CONF* pRule = pRules.get(); pRule != nullptr; pRule = pRule->pNext) {
         if (Value(pRule, "enabled") != "1") {

@@ -1,0 +1,269 @@
+// The stores when something beneath them fails: memory, a full disk, killed writers, several at once.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <functional>
+
+#include "libtavoportmap.h"
+#include "stage.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
+#include "world.h"
+
+namespace {
+
+// What the clock is ahead of the real one, in seconds.
+time_t gNClockAhead = 0;
+
+}  // namespace
+
+extern "C" {
+
+time_t time(time_t* pTime) {
+    timespec now = {};
+    clock_gettime(CLOCK_REALTIME, &now);
+    const time_t nNow = now.tv_sec + gNClockAhead;
+    return pTime == nullptr ? nNow : *pTime = nNow;
+}
+}
+
+namespace {
+
+constexpr char kDir[] = "/etc/portforward";
+constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
+constexpr char kOldRules[] = "[9]\nenabled=1\ns_port=1\nr_port=1\nprotocol name=tcp\n";
+using Lines = std::vector<std::string>;
+
+// Number of rules that the library tells of; -1: it says that it could not tell.
+int CountRules() {
+    int nRules = -7;
+    __tag_TAVO_ROUTER_RULE* pRules = nullptr;
+    const int nResult = TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr);
+    TLibFreeRulesArr(pRules);
+    return nResult == 0 ? nRules : -1;
+}
+
+// No hash takes this key until the stage is cleared.
+void FailToSet(const char* szKey) {
+    gStage.blOn = true;
+    gStage.szFail = szKey;
+}
+
+int Add(RouterRuleConfWriter& writer) {
+    return writer.AddRule("7", true, "1", "2", "tcp", "S", "web");
+}
+
+Lines Names() {
+    Lines rgszNames;
+    for (const auto& entry : std::filesystem::directory_iterator(kDir)) {
+        rgszNames.push_back(entry.path().filename());
+    }
+    std::sort(rgszNames.begin(), rgszNames.end());
+    return rgszNames;
+}
+
+class Faults : public testing::Test {
+protected:
+    void SetUp() override {
+        std::filesystem::remove_all(kDir);
+        std::filesystem::create_directories(kDir);
+        gLog.clear();
+        gSzGateway = "192.168.1.1";
+    }
+    void TearDown() override { gNClockAhead = 0; }
+};
+
+TEST_F(Faults, APairThatCannotBeSetStopsTheRule) {
+    const char* rgszCases[][2] = {{"enabled", "set enable failed"},     {"s_port", "set src port failed"},
+                                  {"r_port", "set router port failed"}, {"protocol name", "set protocol=tcp"},
+                                  {"service_id", "set serviceid=S"},    {"service", "set service name=web"}};
+    RouterRuleConfWriter writer;
+    for (const auto& rgszCase : rgszCases) {
+        gLog.clear();
+        FailToSet(rgszCase[0]);
+        EXPECT_EQ(Add(writer), 0);
+        gStage = {};
+        EXPECT_EQ(gLog, Lines{rgszCase[1]});
+        int nRules = 7;
+        EXPECT_EQ(writer.GetRules(nRules), 1);
+        EXPECT_EQ(nRules, 0);
+    }
+}
+
+TEST_F(Faults, ASettingThatCannotBeSetIsReportedWhereItMatters) {
+    using Writer = RouterConfWriter;
+    const struct {
+        const char* szFail;
+        std::function<int(Writer&)> fnSet;
+        int nResult;
+        Lines rgszLines;
+    } rgCases[] = {
+        {"brand", [](Writer& w) { return w.SetBrandModelVersion("b", "m", "v"); }, 0, {}},
+        {"max", [](Writer& w) { return w.SetMaxRule(1); }, 0, {}},
+        {"pass", [](Writer& w) { return w.SetUserPass("u", "p"); }, 1, {}},
+        {"use_custom_account", [](Writer& w) { return w.SetUserPass("u", "p"); }, 1, {}},
+        {"support_router_upnp", [](Writer& w) { return w.SetSupportUpnp("unknown"); }, 0, {}},
+        {"router_type", [](Writer& w) { return w.SetSupportUpnp("unknown"); }, 1, {"set router type failed"}},
+        {"router_type", [](Writer& w) { return w.SetSupportNatpmp("yes"); }, 1, {"set router type failed"}},
+    };
+    for (const auto& failing : rgCases) {
+        Writer writer(false);
+        EXPECT_EQ(writer.Init(), 1);
+        gLog.clear();
+        FailToSet(failing.szFail);
+        EXPECT_EQ(failing.fnSet(writer), failing.nResult) << failing.szFail;
+        EXPECT_LT(gStage.nWorks, 0) << failing.szFail << " was not reached";
+        gStage = {};
+        EXPECT_EQ(gLog, failing.rgszLines) << failing.szFail;
+    }
+}
+
+TEST_F(Faults, MemoryThatRunsOutAnywhereLosesNoRules) {
+    gBlOneFailure = true;
+    bool blFailed = true;
+    for (int i = 0; blFailed && i < 1000; ++i) {
+        Write(kRuleConf, kOldRules);
+        RouterRuleConfWriter writer;
+        ASSERT_EQ(Add(writer), 1);
+        blFailed = gBlAllocationFailed = false;
+        gNGoodAllocations = i;
+        const bool blSynced = writer.Sync() == 1;
+        gNGoodAllocations = -1;
+        blFailed = gBlAllocationFailed;
+        EXPECT_EQ(Read(kRuleConf) == kOldRules, !blSynced) << i;
+        EXPECT_EQ(Names(), Lines{"rule.conf"}) << i;
+        EXPECT_TRUE(blFailed || blSynced);
+    }
+    EXPECT_FALSE(blFailed);
+    int nReads = 0;
+    for (blFailed = true; blFailed && nReads < 1000; ++nReads) {
+        gBlAllocationFailed = false;
+        gNGoodAllocations = nReads;
+        const int nRules = CountRules();
+        gNGoodAllocations = -1;
+        blFailed = gBlAllocationFailed;
+        EXPECT_TRUE(nRules == 1 || (blFailed && nRules == -1)) << nReads;
+    }
+    EXPECT_FALSE(blFailed);
+    EXPECT_GT(nReads, 10);
+    gBlOneFailure = false;
+}
+
+TEST_F(Faults, AFullDiskLosesNothing) {
+    ASSERT_EQ(mount("tmpfs", "/etc", "tmpfs", 0, "size=32k"), 0);
+    const std::string szRouter = "[192.168.1.1]\nbrand=old\nsupport_router_upnp=yes\nsupport_router_natpmp=no\n";
+    Write(kRuleConf, kOldRules);
+    Write(kRouterConf, szRouter);
+    Write(kSystemConf, "runupnpportmapping=\"yes\"\n");
+    Write("/etc/fill", std::string(100000, 'x'));
+    RouterRuleConfWriter rules;
+    EXPECT_EQ(Add(rules), 1);
+    EXPECT_EQ(rules.Sync(), 0);
+    EXPECT_EQ(gLog, Lines{"save config failed"});
+    RouterConfWriter router(true);
+    EXPECT_EQ(router.SetBrand("new"), 1);
+    EXPECT_EQ(router.Sync(), 0);
+    __tag_TAVO_ROUTER_RULE rule = {};
+    snprintf(rule.szRouterPort, sizeof(rule.szRouterPort), "1");
+    EXPECT_EQ(TLibSaveRules("192.168.1.1", 1, &rule, false, nullptr, nullptr, nullptr), -1);
+    EXPECT_TRUE(Logged("Failed to Set run key [/etc/tavoinfo.conf]"));
+    EXPECT_EQ(Read(kRuleConf), kOldRules);
+    EXPECT_EQ(Read(kRouterConf), szRouter);
+    EXPECT_EQ(Read(kSystemConf), "runupnpportmapping=\"yes\"\n");
+    EXPECT_EQ(Names(), (Lines{"router.conf", "rule.conf"}));
+    std::filesystem::remove("/etc/fill");
+    EXPECT_EQ(rules.Sync() + router.Sync(), 2);
+    EXPECT_NE(Read(kRuleConf), kOldRules);
+    EXPECT_EQ(umount("/etc"), 0);
+}
+
+TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
+    // Name of the copy, its age against the live file in seconds, and whether it goes once it is obsolete.
+    const struct {
+        const char* szName;
+        int nOlder;
+        bool blGoes;
+    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confzzzzZ0", 1, true},   {"rule.confNewer1", -60, false},
+                    {"rule.confbackup", 60, false}, {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},
+                    {"rule.confaB3dE", 60, false},  {"rule.confaB3dE67", 60, false}};
+    Write(kRuleConf, kOldRules);
+    symlink("/etc/portforward/rule.conf.saved", "/etc/portforward/rule.confaBcDe0");
+    for (const auto& copy : rgCopies) {
+        const std::string szPath = std::string(kDir) + "/" + copy.szName;
+        Write(szPath, std::string("[") + copy.szName + "]\nenabled=1\n");
+        std::filesystem::last_write_time(
+            szPath, std::filesystem::last_write_time(kRuleConf) - std::chrono::seconds(copy.nOlder));
+    }
+    const Lines rgszAll = Names();
+    EXPECT_EQ(CountRules(), 1);
+    EXPECT_EQ(Names(), rgszAll) << "a writer may be at work";
+    gNClockAhead = 3600;
+    EXPECT_EQ(CountRules(), 1);
+    for (const auto& copy : rgCopies) {
+        EXPECT_EQ(std::filesystem::exists(std::string(kDir) + "/" + copy.szName), !copy.blGoes) << copy.szName;
+    }
+    EXPECT_TRUE(std::filesystem::is_symlink("/etc/portforward/rule.confaBcDe0"));
+    EXPECT_EQ(Read(kRuleConf), kOldRules);
+
+    std::filesystem::remove(kRuleConf);
+    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
+    EXPECT_EQ(Read(kRuleConf), "[rule.confNewer1]\nenabled=1\n");
+}
+
+TEST_F(Faults, RulesLeftAsideAreNotNoRules) {
+    Write("/etc/portforward/rule.conf.saved", kOldRules);
+    EXPECT_EQ(CountRules(), 0);
+    Write("/etc/portforward/rule.confaB3dE6", kOldRules);
+    EXPECT_EQ(CountRules(), 1);
+    EXPECT_EQ(Names(), (Lines{"rule.conf", "rule.conf.saved"}));
+}
+
+TEST_F(Faults, ReadersNeverSeeFewerRulesThanTwoWritersWrite) {
+    constexpr int kWrites = 150;
+    Write(kRuleConf, std::string(kOldRules) + kOldRules);
+    pid_t rgPids[2] = {};
+    for (pid_t& pid : rgPids) {
+        pid = fork();
+        if (pid == 0) {
+            RouterRuleConfWriter writer;
+            const bool blAdded = Add(writer) + Add(writer) == 2;
+            int nWritten = 0;
+            for (int i = 0; i < kWrites; ++i) {
+                nWritten += writer.Sync();
+            }
+            _exit(blAdded && nWritten > 0 ? 0 : 1);
+        }
+    }
+    int nSeen = 0;
+    for (const pid_t pid : rgPids) {
+        int nStatus = 0;
+        while (waitpid(pid, &nStatus, WNOHANG) == 0) {
+            const int nRules = CountRules();
+            nSeen += nRules == 2 ? 1 : 0;
+            EXPECT_TRUE(nRules == 2 || nRules == -1) << nRules;
+        }
+        EXPECT_EQ(nStatus, 0);
+    }
+    EXPECT_GT(nSeen, 0);
+    EXPECT_EQ(Names(), Lines{"rule.conf"});
+    EXPECT_EQ(CountRules(), 2);
+}
+
+TEST_F(Faults, AReplacedFileKeepsItsMode) {
+    Write(kRuleConf, kOldRules);
+    chmod(kRuleConf, 0640);
+    RouterRuleConfWriter writer;
+    EXPECT_EQ(Add(writer) + writer.Sync(), 2);
+    struct stat status = {};
+    stat(kRuleConf, &status);
+    EXPECT_EQ(status.st_mode & 07777U, 0640U);
+}
+
+}  // namespace
