@@ -257,9 +257,9 @@ class Lab:
 
     # ---- a router with web pages only --------------------------------------------------------------------
 
-    def start_web(self, flavour, fault="none", tls=False, model=None):
+    def start_web(self, flavour, fault="none", tls=False):
         """The scripted web router, and its settings and description on the box."""
-        brand, name, version = model or WEB_MODELS[flavour]
+        brand, name, version = WEB_MODELS[flavour]
         shutil.rmtree("/etc.defaults/portforward/routerdb", ignore_errors=True)
         shutil.copytree(f"{HERE}/../../packaging/routerdb", "/etc.defaults/portforward/routerdb")
         certificate = []
