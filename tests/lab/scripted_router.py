@@ -1,8 +1,10 @@
 """A router with faults: SSDP and SOAP on the LAN address, behaving as the named fault says.
 
-Usage: scripted_router.py FAULT [PORT [ADDRESS]]. GET /table gives its table and its counters as JSON.
+Usage: scripted_router.py FAULT [PORT [ADDRESS]]. GET /table gives its table and its counters as JSON; GET
+/hang?SECONDS has it answer no action for so long.
 """
 import json
+import os
 import re
 import socket
 import struct
@@ -25,6 +27,23 @@ DESCRIPTION = f"""<?xml version="1.0"?><root xmlns="urn:schemas-upnp-org:device-
 <deviceType>urn:schemas-upnp-org:device:InternetGatewayDevice:1</deviceType><manufacturer>{BRAND}</manufacturer>
 <modelName>Scripted</modelName><modelNumber>7</modelNumber><serviceList><service>
 <serviceType>{SERVICE}</serviceType><controlURL>/ctl</controlURL></service></serviceList></device></root>"""
+SERVICES = "<service><serviceType>urn:x:service:Y:1</serviceType><controlURL>/n</controlURL></service>"
+ENTITIES = "".join(f'<!ENTITY e{i + 1} "{f"&e{i};" * 10}">' for i in range(12))
+BODIES = {"garbage_xml": "\0<<garbage", "deep_xml": "<device>" * 30000,
+          "many_services": DESCRIPTION.replace("<service>", SERVICES * 2000 + "<service>", 1),
+          "too_many_services": DESCRIPTION.replace("<service>", SERVICES * 10000 + "<service>", 1),
+          "entities": f"<!DOCTYPE root [<!ENTITY e0 'x'>{ENTITIES}]><root><device>&e12;</device></root>"}
+# What comes first, what comes then without end, and the seconds between.
+STREAMS = {"endless_body": (b"HTTP/1.1 200 OK\r\n\r\n", b"<x>" * 10000, 0),
+           "endless_header": (b"HTTP/1.1 200 OK\r\n", b"X-A: b\r\n" * 100, 0),
+           "endless_line": (b"HTTP/1.1 200 OK\r\nX-A: ", b"b" * 1000, 0),
+           "endless_chunks": (b"HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\n", b"3e8\r\n" + b"a" * 1000 + b"\r\n", 0),
+           "endless_100": (b"", b"HTTP/1.1 100 Continue\r\n\r\n" * 100, 0),
+           "drip": (b"HTTP/1.1 200 OK\r\n\r\n", b"<", 1),
+           "redirect": (f"HTTP/1.1 302 Found\r\nLocation: http://127.0.0.1:{PORT}/d.xml\r\nContent-Length: 0\r\n\r\n"
+                        .encode(), b"", 1)}
+QUICK = [name for name in (*BODIES, *STREAMS) if name not in ("drip", "many_services")]
+HANG_UNTIL = 0
 LOCATIONS = {"location_other_host": f"http://{FOREIGN}:5000/d.xml", "location_loopback": "http://127.0.0.1:5000/d.xml"}
 
 
@@ -71,6 +90,8 @@ def act(action, args):
         if FAULT == "conflict_secure" and key[1] == 5001:
             return fault(606)
         return answer(action, **entry(key)) if key in TABLE else fault(714)
+    if action == "DeletePortMapping" and FAULT == "gives_nothing_back":
+        return fault(606)
     if action == "DeletePortMapping":
         return answer(action) if TABLE.pop(key, None) else fault(714)
     return add(key, args["NewInternalClient"], int(args["NewInternalPort"]), int(args["NewLeaseDuration"]),
@@ -94,17 +115,28 @@ class Handler(BaseHTTPRequestHandler):
 
     def do_GET(self):
         COUNT[self.path] = COUNT.get(self.path, 0) + 1
+        kind = self.path[1:] if FAULT == "bad_descriptions" else FAULT
         if self.path == "/table":
             self.say(299, json.dumps({"table": [[*key, *value] for key, value in TABLE.items()], "count": COUNT}))
-        elif FAULT == "endless_body":
-            self.send_response(200)
-            self.end_headers()
-            while True:
-                self.wfile.write(b"<x>" * 10000)
+        elif self.path.startswith("/hang?"):
+            global HANG_UNTIL
+            HANG_UNTIL = time.monotonic() + float(self.path[6:])
+            self.say(299, "")
+        elif kind in STREAMS:
+            self.stream(*STREAMS[kind])
         elif FAULT == "silent":
             time.sleep(60)
         else:
-            self.say(200, "\0<<garbage" if FAULT == "garbage_xml" else DESCRIPTION)
+            self.say(200, BODIES.get(kind, DESCRIPTION))
+
+    def stream(self, first, then, pause):
+        try:
+            self.wfile.write(first)
+            while True:
+                self.wfile.write(then)
+                time.sleep(pause)
+        except OSError:
+            self.close_connection = True
 
     def do_POST(self):
         action = self.headers["SOAPAction"].strip('"').split("#")[1]
@@ -112,6 +144,12 @@ class Handler(BaseHTTPRequestHandler):
         body = self.rfile.read(int(self.headers["Content-Length"])).decode()
         if FAULT == "late_reply" and action == "AddPortMapping":
             time.sleep(8)
+        time.sleep(max(0, HANG_UNTIL - time.monotonic()))
+        if FAULT == "drips_actions" and action == "AddPortMapping":
+            self.stream(b"HTTP/1.1 200 OK\r\n\r\n", b"<", 1)
+            return
+        if FAULT == "dies_listing" and action == "GetGenericPortMappingEntry" and "Index>1<" in body:
+            os._exit(0)
         self.say(*act(action, dict(re.findall(r"<(New\w+)>([^<]*)<", body))))
 
 
@@ -121,14 +159,20 @@ def listen_ssdp():
     sock.bind(("", 1900))
     sock.setsockopt(socket.IPPROTO_IP, socket.IP_ADD_MEMBERSHIP,
                     struct.pack("4s4s", socket.inet_aton("239.255.255.250"), socket.inet_aton(ADDRESS)))
-    location = LOCATIONS.get(FAULT, f"http://{ADDRESS}:{PORT}/d.xml")
+    locations = [LOCATIONS.get(FAULT, f"http://{ADDRESS}:{PORT}/d.xml")]
+    if FAULT == "ssdp_flood":
+        locations = [f"http://{ADDRESS}@{FOREIGN}:{i}/d.xml" for i in range(5000)] + locations
+    if FAULT == "bad_descriptions":  # the good one comes after all that end quickly
+        locations = [f"http://{ADDRESS}:{PORT}/{name}" for name in QUICK] + locations
     while True:
         _, peer = sock.recvfrom(2000)
         COUNT["ssdp"] = COUNT.get("ssdp", 0) + 1
-        sock.sendto(f"HTTP/1.1 200 OK\r\nST: x\r\nLOCATION: {location}\r\n\r\n".encode(), peer)
+        for location in locations:
+            sock.sendto(f"HTTP/1.1 200 OK\r\nST: x\r\nLOCATION: {location}\r\n\r\n".encode(), peer)
 
 
 if __name__ == "__main__":
-    TABLE.update({("TCP", 1): (FOREIGN, 1, 0, "theirs")} if FAULT == "endless_table" else {})
+    TABLE.update({("TCP", 1): (FOREIGN, 1, 0, "theirs")} if FAULT in ("endless_table", "dies_listing") else {})
+    TABLE.update({("TCP", 2): ("192.168.77.2", 2, 0, "tavo:old")} if FAULT in ("gives_nothing_back", "dies_listing") else {})
     threading.Thread(target=listen_ssdp, daemon=True).start()
     ThreadingHTTPServer((ADDRESS, PORT), Handler).serve_forever()

@@ -298,8 +298,8 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
         }
     }
     SearchGateway(
-        szGateway, szLocal, fnLeft(), nLocalPort, [&](const HttpUrl& location) { return fnTry(location, fnLeft()); },
-        fnStop);
+        szGateway, szLocal, fnLeft(), nLocalPort,
+        [&](const HttpUrl& location) { return fnTry(location, fnLeft() / 2); }, fnStop);
     return pFound;
 }
 

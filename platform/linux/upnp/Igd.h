@@ -36,9 +36,10 @@ TAVO_PLATFORM_API int SoapCode(long nHttpCode, const std::string& szXml);
 
 class TAVO_PLATFORM_API Igd : public Router {
 public:
-    // The IGD at the gateway, found within the limit or not at all. pSzLocation (may be null) is tried
-    // first, for half of it at most, and set to what worked. A search lasts as SearchGateway says. fnStop
-    // is kept for the calls that follow.
+    // The IGD at the gateway, found within the limit or not at all. A description is waited for as long as
+    // half of what is left of the limit, so that one that never comes does not keep the others from being
+    // tried. pSzLocation (may be null) is tried first, and set to what worked. A search lasts as SearchGateway says.
+    // fnStop is kept for the calls that follow.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
                                      std::string* pSzLocation, int nLocalPort = 0,
                                      const std::function<bool()>& fnStop = {});
