@@ -406,7 +406,7 @@ bool SameLists(const PortList* pOne, const PortList* pOther) {
 
 TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
     std::map<std::string, int> seen;
-    for (unsigned nSeed = 1; nSeed <= 40000; ++nSeed) {
+    for (unsigned nSeed = 1; nSeed <= 20000; ++nSeed) {
         RandomRules random(nSeed);
         OperationRules rules1, rules1Copy, rules, rulesCopy;
         random.Fill(rules1, rules1Copy);
@@ -438,9 +438,9 @@ TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
     }
     // Every outcome has been met, often enough to mean something.
     for (const auto& [szLine, nTimes] : seen) {
-        EXPECT_GT(nTimes, 20) << szLine;
+        EXPECT_GT(nTimes, 10) << szLine;
     }
-    EXPECT_GT(seen["success"], 4000);
+    EXPECT_GT(seen["success"], 2000);
     EXPECT_GE(seen.size(), 8U);
 }
 
