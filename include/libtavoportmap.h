@@ -150,6 +150,10 @@ TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, blGeneric) == 3 * 1024, "list lay
 TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, pNext) % sizeof(void*) == 0, "list layout");
 
 /* Progress and outcome of saving rules. Set nStatus to 0 before the call: the save never resets it. */
+#if defined(__clang__)
+#pragma clang diagnostic push
+#pragma clang diagnostic ignored "-Wnested-anon-types" /* knows no __extension__ here */
+#endif
 typedef struct __tag_TAVO_ROUTER_SAVE_RULE_RESULT {
     int nProgress; /* percent: 20, 40, 60, 80, 90, 100 */
     int nStatus;   /* 2 locked, 7 too many rules, 8 port conflict, 9 add failed, 10 to 12 manual router's limits */
@@ -161,6 +165,9 @@ typedef struct __tag_TAVO_ROUTER_SAVE_RULE_RESULT {
         };
     };
 } __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
+#if defined(__clang__)
+#pragma clang diagnostic pop
+#endif
 TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, szPortList) == 8, "save layout");
 TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, nLimit) == 8, "save layout");
 TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT, nLimit2) == 12, "save layout");
