@@ -304,6 +304,9 @@ TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUT
 TAVO_API int TestFuncToPorts(char* szOut, int nOut, const char* szNumbers);
 /* Prints the rules of rule.conf with their ports taken apart. 0 or -1. */
 TAVO_API int TestFuncCreateOpRulesByRuleConf(void);
+/* Shows what a service's request ("hoplink;5000-5001;tcp;6000;udp", nine pairs at most) loses to other
+ * hosts' mappings on a UPnP router. Changes nothing. 0 or -1. */
+TAVO_API int TestFuncDeleteConflictPortsForUPnPRouter(const char* szRequest);
 
 #ifdef __cplusplus
 } /* extern "C" */
@@ -316,6 +319,10 @@ TAVO_API int TestFuncCreateOpRulesByRuleConf(void);
 TAVO_API int TLibParsePorts(std::list<int>& ports, const char* szPort);
 /* The same. */
 TAVO_API int TestFuncTLibParsePorts(std::list<int>& ports, char* szPort);
+/* Appends the outside ports that enabled mappings of other hosts hold on the UPnP router in front, which
+ * it searches for at most 30 seconds. 0 (also without mappings), or -1: no router, no gateway, or no
+ * address of the box's on its subnet. */
+TAVO_API int TestFuncGetUsedRouterPortList(std::list<int>& tcpPorts, std::list<int>& udpPorts);
 
 /* Opens (creating it) and locks szPath without waiting; fd receives the descriptor also when the lock
  * is held elsewhere: pass it to unlock_file in every case. 1: locked; 0: not. */

@@ -1,16 +1,13 @@
-// Port lists as text and back, and the operation rules: built from requests and from rule.conf, written
-// back as public records. Relies on the platform's test of a port number. Promises: a builder that
-// fails frees what it made.
+// The operation rules: built from requests and from rule.conf, written back as public records. Relies on
+// the platform's test of a port number. Promises: a builder that fails frees what it made.
 #include "OperationRules.h"
 
 #include <algorithm>
-#include <climits>
 #include <cstdlib>
 #include <cstring>
 
 namespace {
 
-using tavo::lib::AtBorder;
 using tavo::lib::kHopLinkFile;
 using tavo::lib::LogError;
 using tavo::lib::OPERATION_RULE;
@@ -19,63 +16,6 @@ using tavo::lib::PortList;
 constexpr const char* kProtocols[] = {"tcp", "udp", "all"};
 constexpr char kRelayServiceName[] = "hoplink";
 constexpr char kRelayServiceId[] = "HopLink";
-
-// sscanf leaves a value outside its type undefined; read wide and clamped, it is refused as a port.
-void ReadRange(const char* szToken, int& nLow, int& nHigh) {
-    long nFirst = 0;
-    long nLast = 0;
-    std::sscanf(szToken, "%ld-%ld", &nFirst, &nLast);
-    nLow = static_cast<int>(std::clamp(nFirst, long{INT_MIN}, long{INT_MAX}));
-    nHigh = static_cast<int>(std::clamp(nLast, long{INT_MIN}, long{INT_MAX}));
-}
-
-bool AppendRange(PortList& ports, const char* szToken) {
-    int nLow = 0;
-    int nHigh = 0;
-    ReadRange(szToken, nLow, nHigh);
-    if (TAVOPFIsValidPortNo(nLow) == 0 || TAVOPFIsValidPortNo(nHigh) == 0) {
-        LogError("%s:%d invalid port range [%d-%d]", kHopLinkFile, __LINE__, nLow, nHigh);
-        return false;
-    }
-    if (nLow > nHigh) {
-        std::swap(nLow, nHigh);
-    }
-    for (int nPort = nLow; nPort <= nHigh; ++nPort) {
-        ports.push_back(nPort);
-    }
-    return true;
-}
-
-bool AppendPort(PortList& ports, const char* szToken) {
-    const int nPort = tavo::lib::ToInt(szToken);
-    if (TAVOPFIsValidPortNo(nPort) == 0) {
-        LogError("%s:%d invalid port no [%s]", kHopLinkFile, __LINE__, szToken);
-        return false;
-    }
-    ports.push_back(nPort);
-    return true;
-}
-
-int ParsePorts(PortList& ports, const char* szPort) {
-    if (szPort == nullptr) {
-        LogError("%s:%d Bad parameter, NULL == szPort", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    std::string szCopy = szPort;
-    char* pRest = nullptr;
-    const char* szToken = strtok_r(szCopy.data(), ",", &pRest);
-    if (szToken == nullptr) {
-        LogError("%s:%d invalid port format", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    for (; szToken != nullptr; szToken = strtok_r(nullptr, ",", &pRest)) {
-        const bool blRange = std::strchr(szToken, '-') != nullptr;
-        if (!(blRange ? AppendRange(ports, szToken) : AppendPort(ports, szToken))) {
-            return -1;
-        }
-    }
-    return 0;
-}
 
 bool MakeLists(OPERATION_RULE& rule) {
     rule.routerPortSet = new (std::nothrow) PortList;
@@ -211,10 +151,6 @@ int CountKept(const OPERATION_RULE* rgOpRules, int nOpRules) {
 }
 
 }  // namespace
-
-int TLibParsePorts(std::list<int>& ports, const char* szPort) {
-    return AtBorder(-1, [&] { return ParsePorts(ports, szPort); });
-}
 
 namespace tavo::lib {
 

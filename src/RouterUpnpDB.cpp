@@ -11,13 +11,13 @@ namespace {
 
 constexpr char kFile[] = "src/RouterUpnpDB.cpp";
 constexpr char kDb[] = "/etc/portforward/router_upnp.db";
-constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
 constexpr char kVersionFile[] = "/etc/portforward/routersdk_version";
 constexpr char kDir[] = "/etc/portforward";
 constexpr int kValueSize = 1024;
 constexpr int kVersionSize = 8;
 
 using tavo::lib::AtBorder;
+using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
 
 bool Lookup(const char* szPath, const std::string& szSection, const char* szKey, char (&szValue)[kValueSize]) {
@@ -26,7 +26,7 @@ bool Lookup(const char* szPath, const std::string& szSection, const char* szKey,
 
 // The downloaded file first, then the user's own.
 bool LookupBoth(const std::string& szSection, const char* szKey, char (&szValue)[kValueSize]) {
-    return Lookup(kDb, szSection, szKey, szValue) || Lookup(kUserDb, szSection, szKey, szValue);
+    return Lookup(kDb, szSection, szKey, szValue) || Lookup(kUpnpUserDb, szSection, szKey, szValue);
 }
 
 // A location that is too long for the command is refused: a cut command is another command.
@@ -76,7 +76,7 @@ bool RouterUpnpDB::GetSupport(std::string& support) {
         support = "unknown";
         if (Lookup(kDb, mSzKey, "support", szValue)) {
             support = strcasecmp(szValue, "yes") == 0 ? "yes" : "no";
-        } else if (Lookup(kUserDb, mSzKey, "support", szValue) && strcasecmp(szValue, "yes") == 0) {
+        } else if (Lookup(kUpnpUserDb, mSzKey, "support", szValue) && strcasecmp(szValue, "yes") == 0) {
             support = "yes";
         }
         return true;

@@ -7,9 +7,9 @@
 namespace {
 
 constexpr char kFile[] = "src/RouterUpnpDBUserWriter.cpp";
-constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
 
 using tavo::lib::AtBorder;
+using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
 
 }  // namespace
@@ -56,13 +56,14 @@ bool RouterUpnpDBUserWriter::SetMaxRule(int nMaxRule) {
 }
 
 bool RouterUpnpDBUserWriter::Sync() {
-    if (TLIBCFileExist(kUserDb) == 1) {
-        unlink(kUserDb);
+    if (TLIBCFileExist(kUpnpUserDb) == 1) {
+        unlink(kUpnpUserDb);
     }
     const char* szSection = mPSection == nullptr ? mSzSection.c_str() : mPSection->szSection;
-    const int nAdded = TLIBCFileAddSection(kUserDb, szSection, mPSection == nullptr ? nullptr : mPSection->pHash, 0);
+    const int nAdded =
+        TLIBCFileAddSection(kUpnpUserDb, szSection, mPSection == nullptr ? nullptr : mPSection->pHash, 0);
     if (nAdded != 1) {
-        LogError("%s:%d fail set section into [%s] ret=%d[0x%04X %s:%d]", kFile, __LINE__, kUserDb, nAdded,
+        LogError("%s:%d fail set section into [%s] ret=%d[0x%04X %s:%d]", kFile, __LINE__, kUpnpUserDb, nAdded,
                  static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
         return false;
     }

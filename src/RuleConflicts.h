@@ -87,4 +87,12 @@ int DeletePortsFromRuleConf(OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRu
 int DeletePortsFromInputRules(OPERATION_RULE* rgOpRules, int nOpRules, OPERATION_RULE* rgRuleConfOpRules,
                               int nRuleConfOpRules, const char* szServiceName);
 
+// Appends the router's outside ports that enabled mappings of other hosts hold; asks a UPnP router.
+int GetUsedRouterPortList(PortList& tcpPorts, PortList& udpPorts);
+
+// Takes such ports out of the rules of the service (null: of all rules) in both arrays; a rule for both
+// protocols loses those that are taken for TCP. Nothing happens without the settings of a UPnP router.
+int DeleteConflictPortsForUPnPRouter(OPERATION_RULE* rgOpRules, int nOpRules, OPERATION_RULE* rgOpConfRules,
+                                     int nOpConfRules, const char* szServiceName);
+
 }  // namespace tavo::lib

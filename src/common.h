@@ -27,6 +27,7 @@ inline constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 inline constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 inline constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 inline constexpr char kRouterDbDir[] = "/etc.defaults/portforward/routerdb";
+inline constexpr char kUpnpUserDb[] = "/etc/portforward/router_upnp.db.user";  // the user's own test
 inline constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 inline constexpr char kUpnpRunKey[] = "runupnpportmapping";
 inline constexpr char kNatpmpRunKey[] = "runnatpmpportmapping";
