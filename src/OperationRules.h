@@ -4,6 +4,7 @@
 #pragma once
 
 #include <list>
+#include <optional>
 #include <utility>
 
 #include "common.h"
@@ -54,6 +55,27 @@ inline void FreeRouterRulesArray(__tag_TAVO_ROUTER_RULE* rgRules, int /*nRules*/
     TLibFreeRulesArr(rgRules);
 }
 using RouterRules = OwnedArray<__tag_TAVO_ROUTER_RULE, FreeRouterRulesArray>;
+
+// Walks the pairs of a rule whose lists are there and of one length, from the last to the first, and takes
+// out those that fnIsToGo(router port, box port) says; false, and no further, where it says nothing.
+template <typename Judge>
+bool RemovePairs(OPERATION_RULE& rule, Judge fnIsToGo) {
+    auto itRouter = rule.routerPortSet->end();
+    auto itBox = rule.boxPortSet->end();
+    while (itRouter != rule.routerPortSet->begin()) {
+        --itRouter;
+        --itBox;
+        const std::optional<bool> blToGo = fnIsToGo(*itRouter, *itBox);
+        if (!blToGo) {
+            return false;
+        }
+        if (*blToGo) {  // the successor of what is erased is the place to step back from
+            itRouter = rule.routerPortSet->erase(itRouter);
+            itBox = rule.boxPortSet->erase(itBox);
+        }
+    }
+    return true;
+}
 
 // A list as text: "80-82, 90"; a run may also fall. A text that is too long is cut, and that is success.
 int ToPorts(char* szOutPorts, int nOutPorts, const PortList& ports);

@@ -107,26 +107,17 @@ int DeleteConflictPortsFromOpRule(OPERATION_RULE& opRule, const UsedPorts& used)
     if (!HasEqualSides(opRule)) {
         return -1;
     }
-    PortList& router = *opRule.routerPortSet;
-    PortList& box = *opRule.boxPortSet;
-    if (router.empty()) {
+    if (opRule.routerPortSet->empty()) {
         return 0;
     }
     const PortSet* pUsed = UsedBy(opRule.protocol, used);
-    auto itRouter = router.end();
-    auto itBox = box.end();
-    while (itRouter != router.begin()) {
-        --itRouter;
-        --itBox;
-        if (pUsed != nullptr && pUsed->count(*itRouter) != 0) {
-            itRouter = router.erase(itRouter);
-            itBox = box.erase(itBox);
-        }
-    }
+    RemovePairs(opRule, [pUsed](int nRouterPort, int /*nBoxPort*/) {
+        return std::optional(pUsed != nullptr && pUsed->count(nRouterPort) != 0);
+    });
     if (!HasEqualSides(opRule)) {
         return -1;
     }
-    if (router.empty()) {
+    if (opRule.routerPortSet->empty()) {
         opRule.blDeleted = true;
     }
     return 0;

@@ -75,43 +75,37 @@ bool CheckLists(const OPERATION_RULE& rule, int i) {
     return true;
 }
 
-// One rule of a pass. Walks from the last pair to the first; an erased pair's successor is the place to
-// step back from.
-int DeletePortsFromRule(OPERATION_RULE& rule, OpRulesSearch& search, bool blDeleteFound) {
-    PortList& router = *rule.routerPortSet;
-    PortList& box = *rule.boxPortSet;
-    size_t nVisited = 0;
-    size_t nRemoved = 0;
-    auto itRouter = router.end();
-    auto itBox = box.end();
-    while (itRouter != router.begin()) {
-        --itRouter;
-        --itBox;
-        ++nVisited;
-        auto enStatus = SearchStatus::Unknown;
-        if (search.IsPortInOpRules(*itRouter, *itBox, rule.protocol, &enStatus) != 0) {
-            LogError("%s:%d IsPortInOpRules() failed", kHopLinkFile, __LINE__);
-            return -1;
-        }
-        if (enStatus == SearchStatus::PartialMatched) {
-            LogError("%s:%d failed, port is partial matched", kHopLinkFile, __LINE__);
-            return -1;
-        }
-        if ((enStatus == SearchStatus::Found) == blDeleteFound) {
-            itRouter = router.erase(itRouter);
-            itBox = box.erase(itBox);
-            ++nRemoved;
-        }
+// Whether one pair goes; nothing when that cannot be told.
+std::optional<bool> IsToGo(OpRulesSearch& search, int nRouterPort, int nBoxPort, PORTMAP_PROTOCOL protocol,
+                           bool blDeleteFound) {
+    auto enStatus = SearchStatus::Unknown;
+    if (search.IsPortInOpRules(nRouterPort, nBoxPort, protocol, &enStatus) != 0) {
+        LogError("%s:%d IsPortInOpRules() failed", kHopLinkFile, __LINE__);
+        return std::nullopt;
     }
-    if (router.size() != box.size()) {
-        LogError("%s:%d end, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__, Count(router),
-                 Count(box));
-        return -1;
+    if (enStatus == SearchStatus::PartialMatched) {
+        LogError("%s:%d failed, port is partial matched", kHopLinkFile, __LINE__);
+        return std::nullopt;
     }
-    if (nRemoved == nVisited) {
+    return (enStatus == SearchStatus::Found) == blDeleteFound;
+}
+
+// One rule of a pass.
+bool DeletePortsFromRule(OPERATION_RULE& rule, OpRulesSearch& search, bool blDeleteFound) {
+    if (!RemovePairs(rule, [&](int nRouterPort, int nBoxPort) {
+            return IsToGo(search, nRouterPort, nBoxPort, rule.protocol, blDeleteFound);
+        })) {
+        return false;
+    }
+    if (rule.routerPortSet->size() != rule.boxPortSet->size()) {
+        LogError("%s:%d end, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__,
+                 Count(*rule.routerPortSet), Count(*rule.boxPortSet));
+        return false;
+    }
+    if (rule.routerPortSet->empty()) {
         rule.blDeleted = true;
     }
-    return 0;
+    return true;
 }
 
 }  // namespace
@@ -252,7 +246,7 @@ int DeletePortsFromRules1(OPERATION_RULE* rgOpRules1, int nOpRules1, const OPERA
         if (blFilterOut) {
             continue;
         }
-        if (!CheckLists(rule, i) || DeletePortsFromRule(rule, search, blDeleteFound) != 0) {
+        if (!CheckLists(rule, i) || !DeletePortsFromRule(rule, search, blDeleteFound)) {
             return -1;
         }
     }
