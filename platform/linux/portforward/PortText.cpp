@@ -39,6 +39,10 @@ bool IsWord(std::string_view szText, const char* szWord) {
 
 }  // namespace
 
+std::string PortName(std::string_view szProtocol, uint16_t nPort) {
+    return std::to_string(nPort) + (szProtocol == "TCP" ? "/tcp" : "/udp");
+}
+
 std::optional<std::vector<PortRange>> ParsePortRanges(std::string_view szText) {
     std::vector<PortRange> rgRanges;
     for (size_t nStart = 0; nStart <= szText.size();) {

@@ -24,6 +24,9 @@ struct SingleMapping {
     bool operator==(const SingleMapping&) const = default;
 };
 
+// "5000/tcp", as a user reads it; szProtocol is that of a SingleMapping.
+TAVO_PLATFORM_API std::string PortName(std::string_view szProtocol, uint16_t nPort);
+
 // "80", "80,443", "5000-5010"; a range written backwards counts forwards. Nothing for an empty text or
 // a port outside 1 to 65535.
 TAVO_PLATFORM_API std::optional<std::vector<PortRange>> ParsePortRanges(std::string_view szText);

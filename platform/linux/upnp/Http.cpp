@@ -42,6 +42,7 @@ HttpEnd EndOf(CURLcode enCode) {
         case CURLE_ABORTED_BY_CALLBACK:
             return HttpEnd::kTimeout;
         case CURLE_COULDNT_CONNECT:
+        case CURLE_COULDNT_RESOLVE_HOST:
         case CURLE_SEND_ERROR:
             return HttpEnd::kUnreachable;
         default:
@@ -65,10 +66,14 @@ std::string UrlPart(CURLU* pUrl, CURLUPart enPart) {
 
 }  // namespace
 
-std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl) {
+std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl, bool blTlsToo) {
     const std::unique_ptr<CURLU, UrlFree> pUrl(curl_url());
-    if (!pUrl || curl_url_set(pUrl.get(), CURLUPART_URL, szUrl.c_str(), 0) != CURLUE_OK ||
-        UrlPart(pUrl.get(), CURLUPART_SCHEME) != "http" || !UrlPart(pUrl.get(), CURLUPART_USER).empty()) {
+    if (!pUrl || curl_url_set(pUrl.get(), CURLUPART_URL, szUrl.c_str(), 0) != CURLUE_OK) {
+        return std::nullopt;
+    }
+    const std::string szScheme = UrlPart(pUrl.get(), CURLUPART_SCHEME);
+    const bool blTls = blTlsToo && szScheme == "https";
+    if ((!blTls && szScheme != "http") || !UrlPart(pUrl.get(), CURLUPART_USER).empty()) {
         return std::nullopt;
     }
     const std::string szQuery = UrlPart(pUrl.get(), CURLUPART_QUERY);
@@ -78,22 +83,24 @@ std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl) {
         return std::nullopt;
     }
     return HttpUrl{UrlPart(pUrl.get(), CURLUPART_HOST), nPort,
-                   UrlPart(pUrl.get(), CURLUPART_PATH) + (szQuery.empty() ? "" : "?" + szQuery)};
+                   UrlPart(pUrl.get(), CURLUPART_PATH) + (szQuery.empty() ? "" : "?" + szQuery), blTls};
 }
 
 struct HttpClient::Impl {
     CURL* pCurl = curl_easy_init();
-    long nLimitMilliseconds = kRequestMilliseconds;
+    long nMostMilliseconds;
+    long nLimitMilliseconds = nMostMilliseconds;
     std::function<bool()> fnStop;
+    explicit Impl(int nMost) : nMostMilliseconds(nMost) {}
     ~Impl() { curl_easy_cleanup(pCurl); }
 };
 
-HttpClient::HttpClient() : mPImpl(std::make_unique<Impl>()) {}
+HttpClient::HttpClient(int nMostMilliseconds) : mPImpl(std::make_unique<Impl>(nMostMilliseconds)) {}
 
 HttpClient::~HttpClient() = default;
 
 void HttpClient::SetLimit(int nMilliseconds) {
-    mPImpl->nLimitMilliseconds = std::clamp<long>(nMilliseconds, 1, kRequestMilliseconds);
+    mPImpl->nLimitMilliseconds = std::clamp<long>(nMilliseconds, 1, mPImpl->nMostMilliseconds);
 }
 
 void HttpClient::SetStop(std::function<bool()> fnStop) {
@@ -120,7 +127,8 @@ HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string
     const HeaderList pHeaders = MakeHeaders(rgszHeaders);
     const std::string szUrl = url.Text();
     curl_easy_setopt(pCurl, CURLOPT_URL, szUrl.c_str());
-    curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, "http");
+    curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, url.blTls ? "https" : "http");
+    curl_easy_setopt(pCurl, CURLOPT_IPRESOLVE, CURL_IPRESOLVE_V4);
     curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
     curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);

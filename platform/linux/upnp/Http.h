@@ -1,6 +1,6 @@
-// HTTP towards a router that may be broken or hostile. Relies on libcurl.
+// HTTP towards a router, or a service, that may be broken or hostile. Relies on libcurl.
 // Promises: every request ends within its deadline and its body within its bound; no redirects, no
-// proxies, no other host than the one given.
+// proxies, no other host than the one given, and that by IPv4, of which all mappings are.
 #pragma once
 
 #include <functional>
@@ -13,14 +13,19 @@
 
 namespace tavo {
 
-// An http URL taken apart; nothing for another scheme, an unreadable URL, port 0 or an account in it.
+// A URL taken apart.
 struct HttpUrl {
     std::string szHost;
     int nPort;
     std::string szPath;  // begins with "/"
-    std::string Text() const { return "http://" + szHost + ":" + std::to_string(nPort) + szPath; }
+    bool blTls = false;  // https, with the certificate checked
+    std::string Text() const {
+        return (blTls ? "https://" : "http://") + szHost + ":" + std::to_string(nPort) + szPath;
+    }
 };
-TAVO_PLATFORM_API std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl);
+// Nothing for an unreadable URL, port 0, an account in it, or a scheme other than http and, where blTlsToo,
+// https.
+TAVO_PLATFORM_API std::optional<HttpUrl> ParseHttpUrl(const std::string& szUrl, bool blTlsToo = false);
 
 enum class HttpEnd { kAnswered, kTimeout, kUnreachable, kGarbage };
 
@@ -30,7 +35,7 @@ struct HttpAnswer {
     std::string szBody;
 };
 
-// The most that a request takes, unless it was given less.
+// The most that a request to a router takes.
 inline constexpr int kRequestMilliseconds = 5000;
 
 // What carries requests to a router.
@@ -49,7 +54,8 @@ public:
 // The network. One client keeps its connection open between requests where the router does.
 class TAVO_PLATFORM_API HttpClient : public HttpTransport {
 public:
-    HttpClient();
+    // nMostMilliseconds: for one request, also when SetLimit is given more.
+    explicit HttpClient(int nMostMilliseconds = kRequestMilliseconds);
     ~HttpClient() override;
     HttpClient(const HttpClient&) = delete;
     HttpClient& operator=(const HttpClient&) = delete;

@@ -93,7 +93,7 @@ WantedSet ReadWanted(const char* szRunKey) {
 }
 
 std::string MappingName(const RouterMapping& mapping) {
-    return std::to_string(mapping.nRouterPort) + (mapping.szProtocol == "TCP" ? "/tcp" : "/udp");
+    return PortName(mapping.szProtocol, mapping.nRouterPort);
 }
 
 }  // namespace tavo
