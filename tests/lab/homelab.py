@@ -195,6 +195,17 @@ class Lab:
         except (OSError, ValueError):
             return 0
 
+    @staticmethod
+    def processes_of(command):
+        """The pids of a whole command line."""
+        def line(pid):
+            try:
+                with open(f"/proc/{pid}/cmdline", "rb") as file:
+                    return file.read().rstrip(b"\0").replace(b"\0", b" ").decode()
+            except OSError:
+                return ""
+        return [int(pid) for pid in os.listdir("/proc") if pid.isdigit() and line(pid) == command]
+
     def stop_daemon(self, how=signal.SIGTERM, *daemons):
         for daemon in daemons or DAEMONS:
             pid = self.daemon_pid(daemon)

@@ -1,15 +1,13 @@
-// The event log: what the user must see, one line an event. Relies on appending to a file.
-// Promises: one write a line, so that two processes never mix theirs; control characters are dropped.
-#include <fcntl.h>
+// The event log: what the user must see, one line an event. Relies on LogFile.
+// Promises: control characters are dropped.
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <ctime>
 #include <string>
+#include <utility>
 
 #include "core/Border.h"
-#include "core/Descriptor.h"
 #include "core/TextFile.h"
+#include "log/LogFile.h"
 #include "tavo/log.h"
 
 namespace {
@@ -48,15 +46,6 @@ const char* Message(unsigned nEvent) {
     }
 }
 
-std::string Now() {
-    const std::time_t nNow = std::time(nullptr);
-    std::tm parts = {};
-    char szTime[32] = {};
-    localtime_r(&nNow, &parts);
-    std::strftime(szTime, sizeof(szTime), "%Y-%m-%dT%H:%M:%S%z", &parts);
-    return szTime;
-}
-
 }  // namespace
 
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
@@ -67,18 +56,13 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
         }
         char szEvent[16];
         std::snprintf(szEvent, sizeof(szEvent), "0x%08X", nEvent);
-        std::string szLine = Now() + " " + LevelName(nLevel) + " " + szEvent + " " + Message(nEvent);
+        std::string szLine = tavo::LogTime() + " " + LevelName(nLevel) + " " + szEvent + " " + Message(nEvent);
         for (const char* szText : {szText1, szText2, szText3, szText4}) {
             if (szText != nullptr && *szText != '\0') {
                 szLine += (szLine.ends_with(": ") ? "" : " ") + tavo::PrintableText(szText, kTextSize);
             }
         }
-        szLine += "\n";
         mkdir(kDirectory, 0755);
-        const tavo::Descriptor fd(open(kEventLog, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0640));
-        if (fd.Get() < 0 || write(fd.Get(), szLine.data(), szLine.size()) != static_cast<ssize_t>(szLine.size())) {
-            return Fail(TLIBC_ERR_WRITE, __LINE__);
-        }
-        return 0;
+        return tavo::AppendLogLine(kEventLog, std::move(szLine)) ? 0 : Fail(TLIBC_ERR_WRITE, __LINE__);
     });
 }

@@ -44,7 +44,8 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     }
 }
 
-std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort) {
+std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort, std::string* pSzLocal,
+                                    const std::function<bool()>& fnStop) {
     char szGateway[INET_ADDRSTRLEN] = {};
     char szLocal[INET_ADDRSTRLEN] = {};
     if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0 ||
@@ -52,7 +53,10 @@ std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort) {
         return nullptr;
     }
     KnownRouter known = RecallRouter(szGateway);
-    auto pIgd = Igd::Find(szGateway, szLocal, nLimitMilliseconds, &known.szLocation, nLocalPort);
+    auto pIgd = Igd::Find(szGateway, szLocal, nLimitMilliseconds, &known.szLocation, nLocalPort, fnStop);
+    if (pSzLocal != nullptr) {
+        *pSzLocal = szLocal;
+    }
     if (pIgd != nullptr) {
         KeepRouter(szGateway, known);
     }

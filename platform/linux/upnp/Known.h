@@ -21,7 +21,10 @@ TAVO_PLATFORM_API KnownRouter RecallRouter(const std::string& szGateway);
 TAVO_PLATFORM_API void KeepRouter(const std::string& szGateway, const KnownRouter& router);
 
 // The IGD at the default gateway: where it was the last time, else searched for; what worked is kept.
-// Null when there is no gateway, or no IGD at it.
-std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort);
+// pSzLocal (may be null) is set to the box's own address that faces the gateway. Null when there is no
+// gateway, or no IGD at it. fnStop as Igd::Find has it.
+TAVO_PLATFORM_API std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort,
+                                                      std::string* pSzLocal = nullptr,
+                                                      const std::function<bool()>& fnStop = {});
 
 }  // namespace tavo

@@ -10,6 +10,11 @@
 
 namespace tavo {
 
+// Every description that we give to a rule's mapping begins with this; it tells ours from everybody else's.
+inline constexpr char kOwnPrefix[] = "tavo:";
+// The same for the mappings that only test a router.
+inline constexpr char kTestPrefix[] = "tavotest:";
+
 struct RouterMapping {
     std::string szProtocol;  // "TCP" or "UDP"
     uint16_t nRouterPort = 0;

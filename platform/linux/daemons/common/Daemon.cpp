@@ -4,10 +4,8 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <signal.h>
 #include <sys/file.h>
 #include <sys/inotify.h>
-#include <sys/signalfd.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -17,6 +15,7 @@
 
 #include "core/Descriptor.h"
 #include "core/TextFile.h"
+#include "daemons/common/SignalQueue.h"
 #include "tavo/core.h"
 
 namespace tavo {
@@ -41,50 +40,6 @@ constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
 constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
-
-class SignalQueue {
-public:
-    SignalQueue() {
-        sigemptyset(&mSignals);
-        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT}) {
-            sigaddset(&mSignals, nSignal);
-        }
-        sigprocmask(SIG_BLOCK, &mSignals, nullptr);
-        signal(SIGPIPE, SIG_IGN);
-        mFd.Reset(signalfd(-1, &mSignals, SFD_CLOEXEC | SFD_NONBLOCK));
-    }
-    int Fd() const { return mFd.Get(); }
-
-    // Takes in what has arrived.
-    void Drain() {
-        signalfd_siginfo info = {};
-        while (read(mFd.Get(), &info, sizeof(info)) == sizeof(info)) {
-            if (info.ssi_signo == SIGHUP) {
-                mBlRequested = true;
-            } else {
-                mBlStop = true;
-            }
-        }
-    }
-    bool IsStop() {
-        Drain();
-        return mBlStop;
-    }
-    bool TakeRequest() {
-        Drain();
-        return std::exchange(mBlRequested, false);
-    }
-    bool HasRequest() {
-        Drain();
-        return mBlRequested;
-    }
-
-private:
-    sigset_t mSignals;
-    Descriptor mFd;
-    bool mBlRequested = false;
-    bool mBlStop = false;
-};
 
 // Writes our pid where the library looks for it; it deletes the file before it starts a daemon.
 void WritePidFile(const DaemonNames& names) {

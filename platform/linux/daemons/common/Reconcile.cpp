@@ -7,6 +7,7 @@
 #include <chrono>
 #include <map>
 #include <optional>
+#include <utility>
 
 #include "daemons/common/Wanted.h"
 
@@ -43,7 +44,7 @@ private:
     void RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted);
     std::string Place(const RouterMapping& wanted);
     std::string Create(const RouterMapping& wanted);
-    int AddWithLease(RouterMapping mapping);
+    int AddOwn(RouterMapping mapping);
     std::map<Key, RouterMapping> ShowRanges(const std::vector<RouterMapping>& rgWanted);
     void ReadBack(const std::vector<RouterMapping>& rgWanted);
     std::string Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown);
@@ -134,7 +135,7 @@ std::string Pass::Place(const RouterMapping& wanted) {
         return "1";  // another program of the box made just this one; it is that program's to renew
     }
     const bool blDue = mBlRenew && it->second.nLease != 0;
-    if (blDue && Note(AddWithLease(wanted)) == kRouterOk) {
+    if (blDue && Note(AddOwn(wanted)) == kRouterOk) {
         return kWritten;
     }
     NoteLease(it->second.nLease);
@@ -142,25 +143,16 @@ std::string Pass::Place(const RouterMapping& wanted) {
 }
 
 std::string Pass::Create(const RouterMapping& wanted) {
-    const int nCode = Note(AddWithLease(wanted));
+    const int nCode = Note(AddOwn(wanted));
     if (nCode == kRouterConflict) {
         return AfterConflict(wanted);
     }
     return nCode == kRouterOk ? kWritten : CodeText(nCode);
 }
 
-// Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
-int Pass::AddWithLease(RouterMapping mapping) {
+int Pass::AddOwn(RouterMapping mapping) {
     mapping.szClient = mSzBox;
-    mapping.nLease = mHabit.blPermanentOnly ? 0 : mHabit.nLease;
-    int nCode = mRouter.Add(mapping);
-    if (mapping.nLease != 0 && (nCode == kRouterOnlyPermanentLeases || nCode == kRouterInvalidArgs)) {
-        const bool blSaysSo = nCode == kRouterOnlyPermanentLeases;
-        mapping.nLease = 0;
-        nCode = mRouter.Add(mapping);
-        mHabit.blPermanentOnly = mHabit.blPermanentOnly || (nCode == kRouterOk || blSaysSo);
-    }
-    return nCode;
+    return AddWithLease(mRouter, std::move(mapping), mHabit);
 }
 
 // What the router shows of what was written, where it can show ranges; may be incomplete.
@@ -234,7 +226,7 @@ std::string Pass::AfterConflict(const RouterMapping& wanted) {
     if (!IsOwn(entry) || Note(mRouter.Remove(wanted.szProtocol, wanted.nRouterPort)) != kRouterOk) {
         return CodeText(kRouterConflict);
     }
-    const int nCode = Note(AddWithLease(wanted));
+    const int nCode = Note(AddOwn(wanted));
     return nCode == kRouterOk ? kWritten : CodeText(nCode);
 }
 
@@ -253,6 +245,19 @@ std::string CodeText(int nCode) {
         default:
             return std::to_string(nCode);
     }
+}
+
+// Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
+int AddWithLease(Router& router, RouterMapping mapping, LeaseHabit& habit) {
+    mapping.nLease = habit.blPermanentOnly ? 0 : habit.nLease;
+    int nCode = router.Add(mapping);
+    if (mapping.nLease != 0 && (nCode == kRouterOnlyPermanentLeases || nCode == kRouterInvalidArgs)) {
+        const bool blSaysSo = nCode == kRouterOnlyPermanentLeases;
+        mapping.nLease = 0;
+        nCode = router.Add(mapping);
+        habit.blPermanentOnly = habit.blPermanentOnly || (nCode == kRouterOk || blSaysSo);
+    }
+    return nCode;
 }
 
 PassResult Reconcile(Router& router, const std::vector<RouterMapping>& rgWanted, const std::string& szBox,

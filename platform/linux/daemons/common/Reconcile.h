@@ -18,6 +18,9 @@ struct LeaseHabit {
     bool blPermanentOnly = false;  // it refuses leases
 };
 
+// Asks for one mapping, with its client set and the lease that the router is known to take.
+int AddWithLease(Router& router, RouterMapping mapping, LeaseHabit& habit);
+
 // rgWanted: with client addresses unset; szBox: the box's own address. blRenew: leases are due.
 PassResult Reconcile(Router& router, const std::vector<RouterMapping>& rgWanted, const std::string& szBox,
                      LeaseHabit& habit, bool blRenew, const std::function<bool()>& fnStop);

@@ -20,9 +20,6 @@ struct WantedSet {
     bool blReadable = true;
 };
 
-// Every description that we give begins with this; it tells our mappings from everybody else's.
-inline constexpr char kOwnPrefix[] = "tavo:";
-
 // Whether szRunKey of the system settings is "yes".
 bool IsRunKeyOn(const char* szRunKey);
 

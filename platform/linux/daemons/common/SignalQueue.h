@@ -1,0 +1,59 @@
+// The signals of a daemon, taken in when it asks for them. Relies on signalfd.
+// Promises: SIGHUP is a request, SIGTERM and SIGINT are a stop; none is lost; SIGPIPE never comes.
+#pragma once
+
+#include <signal.h>
+#include <sys/signalfd.h>
+#include <unistd.h>
+
+#include <utility>
+
+#include "core/Descriptor.h"
+
+namespace tavo {
+
+class SignalQueue {
+public:
+    SignalQueue() {
+        sigemptyset(&mSignals);
+        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT}) {
+            sigaddset(&mSignals, nSignal);
+        }
+        sigprocmask(SIG_BLOCK, &mSignals, nullptr);
+        signal(SIGPIPE, SIG_IGN);
+        mFd.Reset(signalfd(-1, &mSignals, SFD_CLOEXEC | SFD_NONBLOCK));
+    }
+    int Fd() const { return mFd.Get(); }
+
+    // Takes in what has arrived.
+    void Drain() {
+        signalfd_siginfo info = {};
+        while (read(mFd.Get(), &info, sizeof(info)) == sizeof(info)) {
+            if (info.ssi_signo == SIGHUP) {
+                mBlRequested = true;
+            } else {
+                mBlStop = true;
+            }
+        }
+    }
+    bool IsStop() {
+        Drain();
+        return mBlStop;
+    }
+    bool TakeRequest() {
+        Drain();
+        return std::exchange(mBlRequested, false);
+    }
+    bool HasRequest() {
+        Drain();
+        return mBlRequested;
+    }
+
+private:
+    sigset_t mSignals;
+    Descriptor mFd;
+    bool mBlRequested = false;
+    bool mBlStop = false;
+};
+
+}  // namespace tavo

@@ -1,0 +1,32 @@
+// The router log: what the tests of a router did and met, one line each. Relies on LogFile.
+// Promises: see tavo/log.h.
+#include <string>
+
+#include "core/Border.h"
+#include "core/TextFile.h"
+#include "log/LogFile.h"
+#include "tavo/log.h"
+
+namespace {
+
+constexpr char kFile[] = "platform/linux/log/RouterLog.cpp";
+constexpr char kRouterLog[] = "/var/log/router.log";
+constexpr size_t kTextSize = 1024;
+constexpr int kRouterLogKind = 1;
+
+int Fail(int nErr, int nLine) {
+    TLIBCErrSet(nErr, kFile, nLine);
+    return -1;
+}
+
+}  // namespace
+
+int TAVOWriteLog(const char* szText, int nKind, int nLevel) {
+    return tavo::AtBorder(-1, [&] {
+        if (szText == nullptr || nKind != kRouterLogKind || nLevel < 1) {
+            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        }
+        const std::string szLine = tavo::LogTime() + " " + tavo::PrintableText(szText, kTextSize);
+        return tavo::AppendLogLine(kRouterLog, szLine) ? 0 : Fail(TLIBC_ERR_WRITE, __LINE__);
+    });
+}
