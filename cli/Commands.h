@@ -9,17 +9,17 @@
 
 namespace tavo::cli {
 
-struct Session {
+struct Request {
     bool blJson = false;
     std::function<Reply()> fnCommand;  // what the arguments ask for
 };
 
-void OfferRules(CLI::App& app, Session& session);
-void OfferSave(CLI::App& app, Session& session);
-void OfferStatus(CLI::App& app, Session& session);
-void OfferDetect(CLI::App& app, Session& session);
-void OfferRouter(CLI::App& app, Session& session);
-void OfferRouters(CLI::App& app, Session& session);
+void OfferRules(CLI::App& app, Request& request);
+void OfferSave(CLI::App& app, Request& request);
+void OfferStatus(CLI::App& app, Request& request);
+void OfferDetect(CLI::App& app, Request& request);
+void OfferRouter(CLI::App& app, Request& request);
+void OfferRouters(CLI::App& app, Request& request);
 
 // A new command below app that takes the options of the commands above it, too.
 CLI::App* AddCommand(CLI::App& app, const std::string& szName, const std::string& szWhat);

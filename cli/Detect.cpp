@@ -4,6 +4,7 @@
 #include <fmt/format.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 
 #include "Box.h"
@@ -19,6 +20,7 @@ namespace {
 struct Wish {
     bool blSave = false;
     bool blLast = false;
+    bool blTrustUpnp = false;
     int nMaxRules = -1;
 };
 
@@ -108,13 +110,18 @@ std::string NextStep(const DetectResult& result) {
                    "  tavoportmap router set --brand BRAND --model MODEL --version VERSION --upnp no --natpmp no \\\n"
                    "      --user NAME --conn-type http --conn-port 80";
         default:
-            return "nobody has recorded whether this router can be trusted with UPnP. If you know that it can:\n"
-                   "  tavoportmap router set --brand BRAND --model MODEL --version VERSION --upnp yes --natpmp no "
-                   "--max-rules 0";
+            return "nobody has recorded whether this router can be trusted with UPnP. To try it:\n"
+                   "  tavoportmap detect --last --save --trust-upnp\n"
+                   "then save a rule and look from outside; 'save' says what the router refused";
     }
 }
 
-Reply Store(const DetectResult& result, const std::string& szGateway, int nMaxRules) {
+Reply Store(DetectResult result, const std::string& szGateway, const Wish& wish) {
+    int nMaxRules = wish.nMaxRules;
+    if (wish.blTrustUpnp && result.enSupportUpnp == TAVO_ROUTER_SUPPORT_UNKNOWN && *result.szModel != '\0') {
+        result.enSupportUpnp = TAVO_ROUTER_SUPPORT_YES;
+        nMaxRules = std::max(nMaxRules, 0);  // nobody knows a limit
+    }
     const Way enWay = WayOf(result);
     if (enWay != Way::kUpnp && enWay != Way::kNatpmp) {
         return {.enExit = kFailed, .szMessage = "nothing was stored: " + NextStep(result)};
@@ -136,7 +143,7 @@ constexpr char kNoLimit[] =
 Reply Conclude(const DetectResult& result, const std::string& szGateway, const Wish& wish, bool blLimitMissing) {
     Reply reply;
     if (wish.blSave) {
-        reply = Store(result, szGateway, wish.nMaxRules);
+        reply = Store(result, szGateway, wish);
     } else {
         reply.szMessage = NextStep(result);
     }
@@ -170,11 +177,13 @@ Reply RunDetect(const Wish& wish, bool blJson) {
 
 }  // namespace
 
-void OfferDetect(CLI::App& app, Session& session) {
+void OfferDetect(CLI::App& app, Request& request) {
     const auto pWish = std::make_shared<Wish>();
     CLI::App* pDetect = AddCommand(app, "detect", "find out what the router is and how to drive it");
     pDetect->add_flag("--save", pWish->blSave, "store the verdict as the router's settings");
     pDetect->add_flag("--last", pWish->blLast, "take the last verdict instead of detecting again");
+    pDetect->add_flag("--trust-upnp", pWish->blTrustUpnp,
+                      "with --save: use UPnP although nobody has recorded that it works on this model");
     pDetect->add_option("--max-rules", pWish->nMaxRules, "with --save: how many rules the router holds; 0: unknown")
         ->check(NumberBetween(0, 65535))
         ->type_name("NUMBER");
@@ -182,7 +191,7 @@ void OfferDetect(CLI::App& app, Session& session) {
         "Looks at the interface, the gateway, the way to the Internet and name resolution, then\n"
         "asks the router itself. It takes some seconds, and it opens no port.\n");
     pDetect->callback(
-        [pWish, &session] { session.fnCommand = [pWish, &session] { return RunDetect(*pWish, session.blJson); }; });
+        [pWish, &request] { request.fnCommand = [pWish, &request] { return RunDetect(*pWish, request.blJson); }; });
 }
 
 }  // namespace tavo::cli

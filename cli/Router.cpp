@@ -215,7 +215,7 @@ Reply Set(const Wish& wish) {
     return StoreSettings(*szGateway, conf, wish.nMaxRules);
 }
 
-void OfferSet(CLI::App& router, Session& session) {
+void OfferSet(CLI::App& router, Request& request) {
     const auto pWish = std::make_shared<Wish>();
     CLI::App* pSet = AddCommand(router, "set", "change what is stored; what is not named stays as it is");
     const auto fnText = [pSet](const char* szName, std::optional<std::string>& szValue, const char* szWhat) {
@@ -244,20 +244,20 @@ void OfferSet(CLI::App& router, Session& session) {
         "Examples:\n"
         "  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes --max-rules 32\n"
         "  tavoportmap router set --user admin --conn-type http --conn-port 80\n");
-    pSet->callback([pWish, &session] { session.fnCommand = [pWish] { return Set(*pWish); }; });
+    pSet->callback([pWish, &request] { request.fnCommand = [pWish] { return Set(*pWish); }; });
 }
 
 }  // namespace
 
-void OfferRouter(CLI::App& app, Session& session) {
+void OfferRouter(CLI::App& app, Request& request) {
     CLI::App* pRouter = AddCommand(app, "router", "the stored settings of the router: show, set");
     pRouter->require_subcommand(1);
     const auto pShowPassword = std::make_shared<bool>(false);
     CLI::App* pShow = AddCommand(*pRouter, "show", "what is stored for the current gateway");
     pShow->add_flag("--show-password", *pShowPassword, "show the password, too");
     pShow->callback(
-        [pShowPassword, &session] { session.fnCommand = [pShowPassword] { return Show(*pShowPassword); }; });
-    OfferSet(*pRouter, session);
+        [pShowPassword, &request] { request.fnCommand = [pShowPassword] { return Show(*pShowPassword); }; });
+    OfferSet(*pRouter, request);
 }
 
 }  // namespace tavo::cli

@@ -90,7 +90,7 @@ Reply Routers(const Wish& wish) {
 
 }  // namespace
 
-void OfferRouters(CLI::App& app, Session& session) {
+void OfferRouters(CLI::App& app, Request& request) {
     const auto pWish = std::make_shared<Wish>();
     CLI::App* pRouters = AddCommand(app, "routers", "the router models that are known, searchable");
     pRouters->add_option("search", pWish->rgszWords, "words that must occur in brand, model or version; any case");
@@ -98,7 +98,7 @@ void OfferRouters(CLI::App& app, Session& session) {
     pRouters->footer(
         "These descriptions are for routers that are driven through their own pages. A router with\n"
         "UPnP or NAT-PMP needs none.\n");
-    pRouters->callback([pWish, &session] { session.fnCommand = [pWish] { return Routers(*pWish); }; });
+    pRouters->callback([pWish, &request] { request.fnCommand = [pWish] { return Routers(*pWish); }; });
 }
 
 }  // namespace tavo::cli

@@ -196,7 +196,7 @@ Reply ListRules() {
     return reply;
 }
 
-void OfferAdd(CLI::App& rules, Session& session) {
+void OfferAdd(CLI::App& rules, Request& request) {
     const auto pNew = std::make_shared<NewRule>();
     Rule& rule = pNew->rule;
     rule.szProtocol = "tcp";
@@ -213,8 +213,8 @@ void OfferAdd(CLI::App& rules, Session& session) {
     pAdd->add_flag("--disabled", pNew->blDisabled, "store it switched off");
     pAdd->add_flag("--force", pNew->blForce, "also when another rule wants the same router port");
     pAdd->footer("Example: tavoportmap rules add web --router-port 443 --box-port 8443\n");
-    pAdd->callback([pNew, &session] {
-        session.fnCommand = [pNew] {
+    pAdd->callback([pNew, &request] {
+        request.fnCommand = [pNew] {
             Rule rule = pNew->rule;
             rule.blEnabled = !pNew->blDisabled;
             rule.szBoxPorts = rule.szBoxPorts.empty() ? rule.szRouterPorts : rule.szBoxPorts;
@@ -223,7 +223,7 @@ void OfferAdd(CLI::App& rules, Session& session) {
     });
 }
 
-void OfferChange(CLI::App& rules, Session& session, const std::string& szVerb, Change enChange,
+void OfferChange(CLI::App& rules, Request& request, const std::string& szVerb, Change enChange,
                  const std::string& szWhat) {
     const auto pId = std::make_shared<std::string>();
     const auto pForce = std::make_shared<bool>(false);
@@ -232,24 +232,24 @@ void OfferChange(CLI::App& rules, Session& session, const std::string& szVerb, C
     if (enChange == Change::kEnable) {
         pVerb->add_flag("--force", *pForce, "also when another rule wants the same router port");
     }
-    pVerb->callback([pId, pForce, enChange, &session] {
-        session.fnCommand = [pId, pForce, enChange] { return ChangeRule(*pId, enChange, *pForce); };
+    pVerb->callback([pId, pForce, enChange, &request] {
+        request.fnCommand = [pId, pForce, enChange] { return ChangeRule(*pId, enChange, *pForce); };
     });
 }
 
 }  // namespace
 
-void OfferRules(CLI::App& app, Session& session) {
+void OfferRules(CLI::App& app, Request& request) {
     CLI::App* pRules = AddCommand(app, "rules", "the stored rules: list, add, remove, enable, disable");
     pRules->require_subcommand(1);
     pRules->footer("The rules live in /etc/portforward/rule.conf; 'tavoportmap save' writes them to the router.\n");
-    AddCommand(*pRules, "list", "show the rules and which of them want the same port")->callback([&session] {
-        session.fnCommand = &ListRules;
+    AddCommand(*pRules, "list", "show the rules and which of them want the same port")->callback([&request] {
+        request.fnCommand = &ListRules;
     });
-    OfferAdd(*pRules, session);
-    OfferChange(*pRules, session, "remove", Change::kRemove, "forget one rule");
-    OfferChange(*pRules, session, "enable", Change::kEnable, "switch one rule on");
-    OfferChange(*pRules, session, "disable", Change::kDisable, "switch one rule off and keep it");
+    OfferAdd(*pRules, request);
+    OfferChange(*pRules, request, "remove", Change::kRemove, "forget one rule");
+    OfferChange(*pRules, request, "enable", Change::kEnable, "switch one rule on");
+    OfferChange(*pRules, request, "disable", Change::kDisable, "switch one rule off and keep it");
 }
 
 }  // namespace tavo::cli

@@ -204,12 +204,12 @@ Reply Save(bool blJson) {
 
 }  // namespace
 
-void OfferSave(CLI::App& app, Session& session) {
+void OfferSave(CLI::App& app, Request& request) {
     CLI::App* pSave = AddCommand(app, "save", "write the rules to the router and wait for its answer");
     pSave->footer(
         "The rules become the router's whole set of ours: what the rules no longer ask for is\n"
         "taken away, mappings of other devices stay. It can take minutes on a slow router.\n");
-    pSave->callback([&session] { session.fnCommand = [&session] { return Save(session.blJson); }; });
+    pSave->callback([&request] { request.fnCommand = [&request] { return Save(request.blJson); }; });
 }
 
 }  // namespace tavo::cli

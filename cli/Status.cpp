@@ -111,9 +111,9 @@ Reply Status() {
 
 }  // namespace
 
-void OfferStatus(CLI::App& app, Session& session) {
-    AddCommand(app, "status", "the gateway, what is known of it, what is running")->callback([&session] {
-        session.fnCommand = &Status;
+void OfferStatus(CLI::App& app, Request& request) {
+    AddCommand(app, "status", "the gateway, what is known of it, what is running")->callback([&request] {
+        request.fnCommand = &Status;
     });
 }
 

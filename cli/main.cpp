@@ -38,19 +38,19 @@ Reply Help(const CLI::App& app) {
     return reply;
 }
 
-Reply Answer(int argc, char** argv, Session& session) {
+Reply Answer(int argc, char** argv, Request& request) {
     CLI::App app("Gets this box's ports through the router in front of it.", "tavoportmap");
     app.footer(kFooter);
     app.require_subcommand(1);
     app.set_help_flag("-h,--help", "print this help");
     app.set_version_flag("--version", "tavoportmap " TAVO_VERSION, "print the version");
-    app.add_flag("--json", session.blJson, "answer with one JSON document");
-    OfferDetect(app, session);
-    OfferRouter(app, session);
-    OfferRouters(app, session);
-    OfferRules(app, session);
-    OfferSave(app, session);
-    OfferStatus(app, session);
+    app.add_flag("--json", request.blJson, "answer with one JSON document");
+    OfferDetect(app, request);
+    OfferRouter(app, request);
+    OfferRouters(app, request);
+    OfferRules(app, request);
+    OfferSave(app, request);
+    OfferStatus(app, request);
     try {
         app.parse(argc, argv);
     } catch (const CLI::CallForHelp&) {
@@ -60,7 +60,7 @@ Reply Answer(int argc, char** argv, Session& session) {
     } catch (const CLI::ParseError& error) {
         return ExplainUsage(app, argc, argv, error);
     }
-    return session.fnCommand();
+    return request.fnCommand();
 }
 
 }  // namespace
@@ -75,11 +75,11 @@ CLI::App* AddCommand(CLI::App& app, const std::string& szName, const std::string
 
 int main(int argc, char** argv) {
     using namespace tavo::cli;
-    Session session;
-    session.blJson = AsksForJson(argc, argv);
+    Request request;
+    request.blJson = AsksForJson(argc, argv);
     try {
-        return Print(Answer(argc, argv, session), session.blJson);
+        return Print(Answer(argc, argv, request), request.blJson);
     } catch (const std::exception& error) {
-        return Print({.enExit = kFailed, .szMessage = Clean(error.what())}, session.blJson);
+        return Print({.enExit = kFailed, .szMessage = Clean(error.what())}, request.blJson);
     }
 }

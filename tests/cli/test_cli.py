@@ -259,7 +259,7 @@ class Tool(unittest.TestCase):
                 (f"0 0 0 1 1 0 32 {steps}", OK, r"driven by +UPnP\n(?s:.)*Acme\\x1b(?s:.)*holds +32 rules(?s:.)*--last --save"),
                 (f"0 0 0 1 2 1 0 {steps}", OK, "driven by +NAT-PMP(?s:.)*no limit known"),
                 (f"0 0 0 1 0 0 -1 {steps}", OK, "driven by +manual(?s:.)*--conn-type http"),
-                (f"0 0 0 1 2 0 -1 {steps}", OK, "driven by +unknown(?s:.)*--upnp yes"),
+                (f"0 0 0 1 2 0 -1 {steps}", OK, "driven by +unknown(?s:.)*--trust-upnp"),
                 (f"0 0 5 2 1 0 32 {steps}", OK, "(?s)gateway setting.*double NAT.*bridge.*outer router, too.*public address"),
                 (f"0 0 2 -1 1 0 32 {steps}", OK, "could not be found out whether another router"),
                 (f"-1 0 0 1 1 0 -1 {steps}", FAILED, "(?s)driven by +UPnP.*not in the compatibility database.*--max-rules"),

@@ -46,6 +46,25 @@ class Detection(unittest.TestCase):
         LAB.write("/etc/portforward/router_upnp.db", f'[{key}]\nsupport="yes"\nmax="48"\n')
         self.expect(detect(), result=0, upnp=YES, max=48, brand=first["brand"])
 
+    def test_first_steps_with_the_tool(self):
+        """From a router that no database knows to an open port, by the commands that the answers name."""
+        tool = f"{BUILD}/cli/tavoportmap"
+        self.addCleanup(LAB.clear_state, "/etc/portforward/router_upnp.db.user")
+        LAB.serve(5002)
+        LAB.start_router()
+        sh("rm -f /etc/portforward/router.conf /etc/portforward/rule.conf")
+        self.assertIn("--last --save --trust-upnp", LAB.run("box", f"{tool} detect").stdout)
+        LAB.run("box", f"{tool} detect --last --save --trust-upnp")
+        LAB.run("box", f"{tool} rules add web --router-port 5001 --box-port 5002")
+        self.assertFalse(LAB.reaches("tcp", 5001))
+        self.assertIn("1 rule in force", LAB.run("box", f"{tool} save").stdout)
+        self.assertTrue(LAB.reaches("tcp", 5001))
+        self.assertIn("upnpd runs", LAB.run("box", f"{tool} status").stdout)
+        LAB.run("box", f"{tool} rules remove 1")
+        LAB.run("box", f"{tool} save")
+        wait_for(lambda: not LAB.mappings(), 10, "the mapping is taken away")
+        LAB.stop_daemon()
+
     def test_gateways_that_are_none(self):
         """No protocol; another device's; a forged address; each ends without UPnP."""
         for title, arguments in (("neither protocol", None), ("another device", ("none", 5000, "lan2", LAN2)),
