@@ -308,6 +308,28 @@ TAVO_API int TestFuncCreateOpRulesByRuleConf(void);
  * hosts' mappings on a UPnP router. Changes nothing. 0 or -1. */
 TAVO_API int TestFuncDeleteConflictPortsForUPnPRouter(const char* szRequest);
 
+/* ---- router tests -------------------------------------------------------------------------------- */
+
+/* Whether the gateway's UPnP can be used: makes nMaxRule (at least 3) test mappings, counts, deletes and
+ * makes them anew, and looks from outside whether the ports follow; takes minutes. 0: passed; 1: a step
+ * failed, and testCompResult says "no"; -1: the test could not run (nStatus 2: locked; 13: no gateway that
+ * speaks UPnP). The callback is called on this thread after each change of nProgress. */
+TAVO_API int TLibTestUpnpCompatibility(int nMaxRule, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* testCompResult,
+                                       void (*pfnCallback)(const __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT*, void*),
+                                       void* pData, bool blLock);
+/* Ends a test that runs, in any process, and deletes its files. Always 0. */
+TAVO_API int TLibStopTestUpnpCompatibility(void);
+/* Keeps the outcome of a test as the user's own entry of the compatibility database, its only one. 0 or -1. */
+TAVO_API int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record);
+/* Sends the files of a failed test to the report server; the archive stays in /tmp. 0 or -1. */
+TAVO_API int TLibUploadTestUpnpCompatibilityFailResult(void);
+/* Makes the port connection test ready; needed before each TLibTestRules after a compatibility test. 0 or -1. */
+TAVO_API int TLibTestRulesInit(void);
+/* Tests from outside whether the rules' ports reach the box and writes each rule's enTestStatus; -1 leaves
+ * them as they were. err may be NULL: 0, or 2 when blLock asked for the router lock and it was held. */
+TAVO_API int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TAVO_LIBTAVOPORTMAP_ERR* err,
+                           bool blLock);
+
 #ifdef __cplusplus
 } /* extern "C" */
 

@@ -8,7 +8,6 @@
 namespace {
 
 constexpr char kFile[] = "src/UpnpDaemon.cpp";
-constexpr char kStatusFile[] = "/var/tmp/upnp_portmap.status";
 constexpr char kAdded[] = "1";
 constexpr char kConflict[] = "718";  // the protocol's ConflictInMappingEntry
 constexpr int kStatusReads = 22;
@@ -32,14 +31,14 @@ void Append(std::string& szList, const char* szItem) {
 bool ReadStatus(Hash& pHash) {
     for (int nRead = 0; nRead < kStatusReads; ++nRead) {
         TLIBCSzHash* pRaw = pHash.release();
-        const int nPairs = TLIBCFileGetKeys(kStatusFile, nullptr, &pRaw, "=");
+        const int nPairs = TLIBCFileGetKeys(tavo::lib::kUpnpStatus, nullptr, &pRaw, "=");
         pHash.reset(pRaw);
         if (nPairs != -1) {
             return true;
         }
         sleep(kReadRetrySeconds);
     }
-    LogError("%s:%d failed to read key-value pairs from %s", kFile, __LINE__, kStatusFile);
+    LogError("%s:%d failed to read key-value pairs from %s", kFile, __LINE__, tavo::lib::kUpnpStatus);
     return false;
 }
 

@@ -324,6 +324,26 @@ void FileLock::LeaveToParent() {
     mFd = -1;
 }
 
+bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
+    if (lock.Get()) {
+        return true;
+    }
+    LogError("%s:%d PortForward conflict = %s", kEntryFile, __LINE__, kRouterLock);
+    if (pErr != nullptr) {
+        *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
+    }
+    return false;
+}
+
+bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule) {
+    if (rules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
+                      rule.szServiceID, rule.szServiceName) == 0) {
+        LogError("%s:%d add rule failed", kEntryFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
 bool SetRunKey(const char* szKey, const char* szValue) {
     return TLIBCFileSetKeyValue(kSystemConf, szKey, szValue, kKeyLineFormat) >= 0;
 }

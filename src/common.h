@@ -21,6 +21,8 @@ class Task;
 
 namespace tavo::lib {
 
+// The source path in the log lines of the entry points with C types, in whichever file they stand.
+inline constexpr char kEntryFile[] = "src/libtavoportmap.cpp";
 inline constexpr char kRouterLock[] = "/tmp/routerconf.lock";
 inline constexpr char kProgressMarker[] = "/tmp/pfProgress";
 inline constexpr char kRouterConf[] = "/etc/portforward/router.conf";
@@ -29,6 +31,10 @@ inline constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 inline constexpr char kRouterDbDir[] = "/etc.defaults/portforward/routerdb";
 inline constexpr char kUpnpUserDb[] = "/etc/portforward/router_upnp.db.user";  // the user's own test
 inline constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
+inline constexpr char kUpnpStatus[] = "/var/tmp/upnp_portmap.status";
+inline constexpr char kTestProgress[] = "/tmp/upnp_test.progress";
+inline constexpr char kPortTestMarker[] = "/tmp/pfStatusRule";
+inline constexpr char kRouterLog[] = "/var/log/router.log";
 inline constexpr char kUpnpRunKey[] = "runupnpportmapping";
 inline constexpr char kNatpmpRunKey[] = "runnatpmpportmapping";
 inline constexpr char kTaskOwner[] = "@system";
@@ -92,6 +98,13 @@ class RouterLock : public FileLock {
 public:
     RouterLock() : FileLock(kRouterLock) {}
 };
+
+// The lock of an entry point that was asked to take it. False: held elsewhere, which is logged and, unless
+// pErr is null, told as a conflict.
+bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr);
+
+// Adds a caller's rule to a rule file that is being built. False: it was refused, which is logged.
+bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule);
 
 // Sets one of the two run keys of the system settings. False: it could not be written.
 bool SetRunKey(const char* szKey, const char* szValue);

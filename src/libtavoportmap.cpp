@@ -24,6 +24,7 @@ constexpr unsigned kPollSeconds = 1;
 
 using tavo::lib::AtBorder;
 using tavo::lib::FillText;
+using tavo::lib::GetRouterLock;
 using tavo::lib::kNatpmpRunKey;
 using tavo::lib::kProgressMarker;
 using tavo::lib::kRouterConf;
@@ -37,18 +38,6 @@ using tavo::lib::SetRunKey;
 int gFdRouterLock = -1;
 
 constexpr const char* kSupportWords[] = {"no", "yes", "unknown"};
-
-// The lock of an entry point that was asked to take it; pErr may be null.
-bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
-    if (lock.Get()) {
-        return true;
-    }
-    LogError("%s:%d PortForward conflict = %s", kFile, __LINE__, kRouterLock);
-    if (pErr != nullptr) {
-        *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
-    }
-    return false;
-}
 
 }  // namespace
 
@@ -924,15 +913,6 @@ void RuleSave::Ports(int nStatus, const std::string& szPorts) {
     }
 }
 
-bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule) {
-    if (rules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
-                      rule.szServiceID, rule.szServiceName) == 0) {
-        LogError("%s:%d add rule failed", kFile, __LINE__);
-        return false;
-    }
-    return true;
-}
-
 bool RuleSave::CollectRules() {
     for (int i = 0; HasRules() && i < mNRules; ++i) {
         const __tag_TAVO_ROUTER_RULE& rule = mRgRules[i];
@@ -940,7 +920,7 @@ bool RuleSave::CollectRules() {
             LogError("%s:%d protocol, and port should not be empty", kFile, __LINE__);
             return false;
         }
-        if (!AddRule(mRules, rule)) {
+        if (!tavo::lib::AddRule(mRules, rule)) {
             return false;
         }
     }

@@ -1,0 +1,175 @@
+// What a compatibility test leaves behind: the user's own entry in the database, and the report of a failure.
+// Relies on the database's writer, the last detection, the settings of the router, tar and curl.
+// Promises: the user's settings are back in their place whatever happens; no text from the router leaves /tmp
+// or reaches a shell as anything but a name.
+#include <ctime>
+#include <string_view>
+
+#include "common.h"
+#include "tavo/upnptest.h"
+
+namespace {
+
+using tavo::lib::AtBorder;
+using tavo::lib::FillText;
+using tavo::lib::kEntryFile;
+using tavo::lib::kPortTestMarker;
+using tavo::lib::kRouterConf;
+using tavo::lib::kRouterLog;
+using tavo::lib::kTestProgress;
+using tavo::lib::kUpnpStatus;
+using tavo::lib::LogError;
+using RouterConf = __tag_TAVO_ROUTER_CONF;
+using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
+
+constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
+constexpr char kReportUser[] = "tavoreportuser";
+constexpr char kReportPassword[] = "rtrsubmit417";
+
+// The brand as a part of a file name and of a command: whatever could leave either becomes "_".
+std::string ArchiveBrand(const char* szBrand) {
+    constexpr std::string_view kPlain = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789 ._-+()";
+    std::string szName = szBrand;
+    for (char& c : szName) {
+        c = kPlain.find(c) == std::string_view::npos ? '_' : c;
+    }
+    return szName.find_first_not_of('.') == std::string::npos ? "" : szName;
+}
+
+// The router settings, moved aside for as long as the object lives.
+class SettingsAside {
+public:
+    SettingsAside() : mSzAside(tavo::lib::UniqueName(kRouterConf)) {}
+    ~SettingsAside() {
+        if (TLIBCFileExist(mSzAside.c_str()) == 1 && rename(mSzAside.c_str(), kRouterConf) != 0) {
+            LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, mSzAside.c_str(), kRouterConf);
+        }
+    }
+    SettingsAside(const SettingsAside&) = delete;
+    SettingsAside& operator=(const SettingsAside&) = delete;
+
+    bool Move() const {
+        if (TLIBCFileExist(kRouterConf) != 1 || rename(kRouterConf, mSzAside.c_str()) == 0) {
+            return true;
+        }
+        LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());
+        return false;
+    }
+
+private:
+    std::string mSzAside;
+};
+
+bool DescribeDetected(RouterConf& conf, std::string& szBrand) {
+    DetectResult detected = {};
+    if (TLibGetRouterDetectResult(&detected) != 0) {
+        LogError("%s:%d TLibGetRouterDetectResult() failed", kEntryFile, __LINE__);
+        return false;
+    }
+    szBrand = detected.szBrand;
+    FillText(conf.szBrand, detected.szBrand);
+    FillText(conf.szModel, detected.szModel);
+    FillText(conf.szVersion, detected.szVersion);
+    if (TLibSupportEnumToString(conf.szSupportUpnp, sizeof(conf.szSupportUpnp),
+                                static_cast<__tag_TAVO_ROUTER_SUPPORT>(detected.enSupportUpnp)) != 0) {
+        LogError("%s:%d TLibSupportEnumToString(enSupportUpnp) failed", kEntryFile, __LINE__);
+        return false;
+    }
+    if (TLibSupportEnumToString(conf.szSupportNatpmp, sizeof(conf.szSupportNatpmp),
+                                static_cast<__tag_TAVO_ROUTER_SUPPORT>(detected.enSupportNatpmp)) != 0) {
+        LogError("%s:%d TLibSupportEnumToString(enSupportNatpmp) failed", kEntryFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+bool PackReport(const std::string& szArchive) {
+    char szCommand[tavo::lib::kCommandSize] = {};
+    std::snprintf(szCommand, sizeof(szCommand), "/bin/tar -zcvf '%s' %s %s %s %s %s >/dev/null 2>&1", szArchive.c_str(),
+                  kRouterConf, kTestProgress, kUpnpStatus, kRouterLog, kPortTestMarker);
+    if (TLIBCSystem(szCommand) != 0) {
+        LogError("%s:%d failed to tar test upnp router result![0x%04X %s:%d]", kEntryFile, __LINE__,
+                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
+        return false;
+    }
+    if (TLIBCFileExist(szArchive.c_str()) != 1) {
+        LogError("%s:%d can't found result file [%s]", kEntryFile, __LINE__, szArchive.c_str());
+        return false;
+    }
+    return true;
+}
+
+bool SendReport(const std::string& szArchive) {
+    char szCommand[tavo::lib::kCommandSize] = {};
+    std::snprintf(szCommand, sizeof(szCommand),
+                  "%s --digest -u '%s:%s' -F 'uploadedfile=@%s;filename=%s' '%s' >/dev/null 2>&1", "/usr/tavo/bin/curl",
+                  kReportUser, kReportPassword, szArchive.c_str(), szArchive.c_str(),
+                  tavo::lib::InQuotes(GetUPnPReportServer()).c_str());
+    if (TLIBCSystem(szCommand) != 0) {
+        LogError("%s:%d update upnp router info failed", kEntryFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+std::string ArchiveName(const std::string& szBrand) {
+    char szArchive[2 * TAVO_TEXT_SIZE] = {};
+    const auto nNow = static_cast<long>(std::time(nullptr));
+    if (szBrand.empty()) {
+        std::snprintf(szArchive, sizeof(szArchive), "/tmp/upnpresult_%ld.tgz", nNow);
+    } else {
+        std::snprintf(szArchive, sizeof(szArchive), "/tmp/%s_%ld.tgz", szBrand.c_str(), nNow);
+    }
+    return szArchive;
+}
+
+}  // namespace
+
+int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record) {
+    return AtBorder(-1, [&] {
+        if (record == nullptr) {
+            LogError("%s:%d record is NULL", kEntryFile, __LINE__);
+            return -1;
+        }
+        RouterUpnpDBUserWriter writer(std::string(record->szBrand) + "/" + record->szModel + "/" + record->szVersion);
+        if (!writer.SetSupport(record->szSupport)) {
+            LogError("%s:%d set support failed", kEntryFile, __LINE__);
+            return -1;
+        }
+        if (!writer.SetMaxRule(record->nMaxRule)) {
+            LogError("%s:%d set max rule failed", kEntryFile, __LINE__);
+            return -1;
+        }
+        if (!writer.Sync()) {
+            LogError("%s:%d fail add section into [%s][0x%04X %s:%d]", kEntryFile, __LINE__, kUserDb,
+                     static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
+            return -1;
+        }
+        return 0;
+    });
+}
+
+int TLibUploadTestUpnpCompatibilityFailResult() {
+    return AtBorder(-1, [&] {
+        RouterConf conf = {};
+        std::string szBrand;
+        if (!DescribeDetected(conf, szBrand)) {
+            return -1;
+        }
+        const SettingsAside aside;
+        if (!aside.Move()) {
+            return -1;
+        }
+        char szGateway[TAVO_TEXT_SIZE] = {};
+        if (TLibGetGatewayIP(szGateway, sizeof(szGateway)) != 0) {
+            LogError("%s:%d TLibGetGatewayIP() failed", kEntryFile, __LINE__);
+            return -1;
+        }
+        if (TLibSetRouterConf(szGateway, &conf, nullptr, true) != 0) {
+            LogError("%s:%d set router.conf failed", kEntryFile, __LINE__);
+            return -1;
+        }
+        const std::string szArchive = ArchiveName(ArchiveBrand(szBrand.c_str()));
+        return PackReport(szArchive) && SendReport(szArchive) ? 0 : -1;
+    });
+}

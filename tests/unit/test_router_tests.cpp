@@ -1,0 +1,359 @@
+// The compatibility test, its record and report, and the port test, with a test client that each test
+// scripts: what it answers and what it writes into the progress file.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <map>
+
+#include "libtavoportmap.h"
+#include "network.h"
+#include "tavo/core.h"
+#include "tavo/porttest.h"
+#include "tavo/task.h"
+#include "tavo/upnptest.h"
+#include "world.h"
+
+namespace {
+
+using TestResult = __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
+
+constexpr char kProgress[] = "/tmp/upnp_test.progress";
+
+// The answers of the test client; a step's word is what stands in the progress file once it is asked for.
+struct TestClient {
+    std::map<std::string, int> mapAnswers;
+    std::map<std::string, std::string> mapWords;
+    std::vector<std::string> rgszCalls;
+    int nTester = 0;
+    std::vector<int> rgVerdicts;
+    std::vector<std::string> rgszRouterLog;
+
+    int Call(const std::string& szCall, int nDefault) {
+        rgszCalls.push_back(szCall);
+        const auto it = mapAnswers.find(szCall);
+        return it == mapAnswers.end() ? nDefault : it->second;
+    }
+};
+TestClient* gPClient = nullptr;
+
+void Put(const char* szStep, const std::string& szWord) {
+    TLIBCFileSetKeyValue(kProgress, szStep, szWord.c_str(), nullptr);
+}
+
+// The tool has worked on a step.
+void Work(const char* szStep) {
+    const auto it = gPClient->mapWords.find(szStep);
+    Put(szStep, it == gPClient->mapWords.end() ? "finished" : it->second);
+}
+
+}  // namespace
+
+extern "C" {
+int TAVOUPnPAddTest(int nRules) {
+    if (gPClient == nullptr) {
+        return Real("TAVOUPnPAddTest", &TAVOUPnPAddTest)(nRules);
+    }
+    Work("upnp_add");
+    return gPClient->Call("add", nRules == 10 ? 0 : -1);
+}
+int TAVOUPnPCountMaxRule() {
+    return gPClient == nullptr ? Real("TAVOUPnPCountMaxRule", &TAVOUPnPCountMaxRule)() : gPClient->Call("count", 10);
+}
+int TAVOUPnPDeletetest() {
+    if (gPClient == nullptr) {
+        return Real("TAVOUPnPDeletetest", &TAVOUPnPDeletetest)();
+    }
+    Work("upnp_delete");
+    return gPClient->Call("delete", 0);
+}
+int TAVOUPnPSetupTest(int nLimit, int nFlags) {
+    if (gPClient == nullptr) {
+        return Real("TAVOUPnPSetupTest", &TAVOUPnPSetupTest)(nLimit, nFlags);
+    }
+    return gPClient->Call("setup", nLimit == 60 && nFlags == 0 ? 0 : -1);
+}
+int TAVOUPnPPortTest(int blAdded) {
+    if (gPClient == nullptr) {
+        return Real("TAVOUPnPPortTest", &TAVOUPnPPortTest)(blAdded);
+    }
+    return gPClient->Call(blAdded == 1 ? "open" : "closed", 0);
+}
+int TAVOUPnPModifyRule() {
+    if (gPClient == nullptr) {
+        return Real("TAVOUPnPModifyRule", &TAVOUPnPModifyRule)();
+    }
+    Work("upnp_readd1");
+    Work("upnp_readd2");
+    return gPClient->Call("modify", 0);
+}
+int TAVOUpnpRemoveTestRulePath() {
+    return gPClient == nullptr ? Real("TAVOUpnpRemoveTestRulePath", &TAVOUpnpRemoveTestRulePath)()
+                               : gPClient->Call("end", 0);
+}
+int TAVOUpnpReportTestProgress(const char* szStep, const char* szValue, int nFlags) {
+    if (gPClient == nullptr) {
+        return Real("TAVOUpnpReportTestProgress", &TAVOUpnpReportTestProgress)(szStep, szValue, nFlags);
+    }
+    Put(szStep, szValue);
+    return 0;
+}
+int TAVOWriteLog(const char* szText, int nKind, int nLevel) {
+    if (gPClient == nullptr) {
+        return Real("TAVOWriteLog", &TAVOWriteLog)(szText, nKind, nLevel);
+    }
+    gPClient->rgszRouterLog.push_back(std::string(szText).substr(std::string(szText).find(' ') + 1));
+    return 0;
+}
+int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* rgStatus, int nRules) {
+    if (gPClient == nullptr) {
+        return Real("TavoPortConnTest", &TavoPortConnTest)(pRules, nFlags, rgStatus, nRules);
+    }
+    for (int i = 0; gPClient->nTester == 0 && i < nRules; ++i) {
+        rgStatus[i].enStatus = gPClient->rgVerdicts[static_cast<size_t>(i)];
+    }
+    return gPClient->Call(nFlags == 1 ? "test" : "?", gPClient->nTester);
+}
+}
+
+namespace {
+
+class RouterTests : public testing::Test {
+protected:
+    void SetUp() override {
+        for (const char* szDir : {"/etc/portforward", "/usr/tavo/bin", "/var/lib/tavo/tasks"}) {
+            std::filesystem::remove_all(szDir);
+            std::filesystem::create_directories(szDir);
+        }
+        Write("/etc/portforward/router_upnp.db", "[x/y/1]\nsupport=yes\n");
+        for (const char* szFile : {kProgress, "/tmp/pfStatusRule"}) {
+            std::filesystem::remove(szFile);
+        }
+        gLog.clear();
+        gSzGateway = "192.168.1.1";
+        gPNetwork = &mNetwork;
+        gPClient = &mClient;
+    }
+    void TearDown() override {
+        gPNetwork = nullptr;
+        gPClient = nullptr;
+        TLIBCKill("/usr/tavo/sbin/upnpd --debug -p", SIGKILL);
+    }
+    Network mNetwork;
+    TestClient mClient;
+};
+
+struct StepCase {
+    const char* szWhat;
+    std::map<std::string, int> mapAnswers;
+    std::map<std::string, std::string> mapWords;
+    int nResult;
+    int nStatusWithoutModel;
+    int nLastPercent;  // before the record is filled
+    const char* szLine;
+};
+
+void Note(const TestResult* pResult, void* pData) {
+    static_cast<std::vector<int>*>(pData)->push_back(pResult->nProgress);
+}
+
+TEST_F(RouterTests, EachStepThatFails) {
+    const StepCase rgCases[] = {
+        {"all pass", {}, {}, 0, 0, 90, ""},
+        {"add", {{"add", -1}}, {}, 1, 14, 30, "TavoUpnpTestAdd() failed"},
+        {"add fails later", {}, {{"upnp_add", "failed"}}, 1, 14, 30, "TavoUpnpTestWaitMessage(upnp_add) failed"},
+        {"odd word", {}, {{"upnp_add", "done"}}, 1, 14, 30, "unknown error szValue=done"},
+        {"count", {{"count", 0}}, {}, 1, 15, 60, "TavoUpnpTestMaxRuleGet() failed"},
+        {"delete", {{"delete", -1}}, {}, 1, 16, 40, "TavoUpnpTestDeleteRules() failed"},
+        {"setup", {{"setup", -1}}, {}, 1, 18, 50, "TavoUpnpTestConnForDeletedPorts() failed"},
+        {"deleted ports stay open", {{"closed", 1}}, {}, 1, 18, 50, "TavoUpnpTestConnForDeletedPorts() failed"},
+        {"re-add", {{"modify", -1}}, {}, 1, 19, 70, "TavoUpnpTestReAdd() failed"},
+        {"second re-add", {}, {{"upnp_readd2", "failed"}}, 1, 19, 70, "TavoUpnpTestWaitMessage(upnp_readd2) failed"},
+        {"ports stay closed", {{"open", 1}}, {}, 1, 17, 80, "TavoUpnpTestConnForAddedPorts() failed"},
+        {"no end", {{"end", -1}}, {}, 1, 20, 90, "TavoUpnpTestTerminate() failed"},
+    };
+    const std::vector<int> rgOrder = {10, 20, 30, 60, 40, 50, 70, 80, 90};
+    for (const bool blNamed : {true, false}) {
+        for (const StepCase& step : rgCases) {
+            SCOPED_TRACE(step.szWhat);
+            gLog.clear();
+            mClient = TestClient();
+            mClient.mapAnswers = step.mapAnswers;
+            mClient.mapWords = step.mapWords;
+            mNetwork.model = blNamed ? TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"} : TAVO_UPNP_GATEWAY_MODEL{};
+            TestResult result = {};
+            result.nStatus = 77;
+            std::vector<int> rgProgress;
+            EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, &Note, &rgProgress, true), step.nResult);
+            std::vector<int> rgWanted(rgOrder.begin(),
+                                      std::find(rgOrder.begin(), rgOrder.end(), step.nLastPercent) + 1);
+            if (blNamed) {
+                rgWanted.push_back(100);
+            }
+            EXPECT_EQ(mNetwork.nUpnpPort, 55001);
+            EXPECT_EQ(rgProgress, rgWanted);
+            EXPECT_EQ(result.nStatus, blNamed ? 0 : step.nStatusWithoutModel);
+            EXPECT_STREQ(result.szSupport, !blNamed ? "" : step.nResult == 0 ? "yes" : "no");
+            EXPECT_EQ(result.nMaxRule, !blNamed ? 0 : step.nResult == 0 ? 10 : -1);
+            EXPECT_TRUE(*step.szLine == '\0' || Logged(step.szLine));
+            EXPECT_EQ(Logged("fillTestCompResult() failed"), !blNamed);
+            EXPECT_EQ(mClient.rgszRouterLog.front(), "=====init upnp start=====");
+        }
+    }
+}
+
+TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
+    EXPECT_EQ(TLibTestUpnpCompatibility(2, nullptr, nullptr, nullptr, false), -1);
+    EXPECT_TRUE(Logged("nMaxRule=2 < 3 is out of range"));
+    EXPECT_EQ(TLibTestUpnpCompatibility(3, nullptr, nullptr, nullptr, false), -1);
+    EXPECT_TRUE(Logged("testCompResult is NULL"));
+    EXPECT_EQ(mClient.rgszCalls, (std::vector<std::string>{"end", "end"}));
+
+    TestResult result = {};
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), -1);
+    EXPECT_EQ(result.nStatus, 2);
+    TLibTavoPortMapUnLock();
+    mNetwork.nUpnpInit = 1;
+    EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), -1);
+    EXPECT_EQ(result.nStatus, 13);
+    EXPECT_EQ(result.nProgress, 20);
+    EXPECT_EQ(mClient.rgszCalls.back(), "end");
+
+    // A daemon in test mode, by its command line.
+    ASSERT_EQ(TLIBCSystem("perl -e '$0 = \"/usr/tavo/sbin/upnpd --debug -p\"; sleep 60' >/dev/null 2>&1 &"), 0);
+    for (int i = 0; i < 500 && TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p") != 1; ++i) {
+        usleep(10000);
+    }
+    ASSERT_EQ(TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p"), 1);
+    mNetwork.nUpnpInit = 0;
+    EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), -1);
+    EXPECT_TRUE(Logged("upnp compatibility test process:/usr/tavo/sbin/upnpd --debug -p is running"));
+    EXPECT_EQ(mClient.rgszCalls.back(), "delete");
+    Write(kProgress, "x=\"y\"\n");
+    EXPECT_EQ(TLibStopTestUpnpCompatibility(), 0);
+    for (int i = 0; i < 500 && TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p") == 1; ++i) {
+        usleep(10000);
+    }
+    EXPECT_EQ(TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p"), 0);  // SIGHUP ended it
+    EXPECT_FALSE(std::filesystem::exists(kProgress));
+}
+
+TEST_F(RouterTests, RecordIsTheOnlyOne) {
+    __tag_TAVO_ROUTER_RECORD record = {};
+    EXPECT_EQ(TLibWriteRecordIntoUpnpDB(nullptr), -1);
+    EXPECT_TRUE(Logged("record is NULL"));
+    snprintf(record.szSupport, sizeof(record.szSupport), "yes");
+    record.nMaxRule = 32;
+    EXPECT_EQ(TLibWriteRecordIntoUpnpDB(&record), 0);
+    EXPECT_EQ(Read("/etc/portforward/router_upnp.db.user"), "[//]\nsupport=\"yes\"\nmax=\"32\"\n\n");
+    snprintf(record.szBrand, sizeof(record.szBrand), "a\"]\n[b");
+    EXPECT_EQ(TLibWriteRecordIntoUpnpDB(&record), 0);
+    int nMax = 0;
+    EXPECT_TRUE(RouterUpnpDB("a\"]\n[b", "", "").GetMaxRule(nMax));
+    EXPECT_EQ(nMax, 32);
+}
+
+struct ReportCase {
+    const char* szBrand;
+    const char* szArchive;  // before "_SECONDS.tgz"
+    bool blSettings;
+    int nCurl;
+};
+
+TEST_F(RouterTests, ReportArchivesAndPutsTheSettingsBack) {
+    const ReportCase rgCases[] = {{"Acme (EU) R-1+", "Acme (EU) R-1+", true, 0},
+                                  {"x'; touch /tmp/owned; '", "x__ touch _tmp_owned_ _", true, 0},
+                                  {"../../etc/x", ".._.._etc_x", false, 0},
+                                  {"..", "upnpresult", true, 0},
+                                  {"", "upnpresult", true, 1}};
+    for (const char* szFile : {kProgress, "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule"}) {
+        Write(szFile, "a=\"b\"\n");
+    }
+    for (const ReportCase& report : rgCases) {
+        SCOPED_TRACE(report.szBrand);
+        NOS::Task task("@system", ".upnp_detector");
+        task.beginUpdate();
+        task.setProperty("router_brand", report.szBrand);
+        task.setProperty("router_model", "m");
+        task.setProperty("support_upnp", "yes");
+        task.setProperty("able_get_brand_model_version", "yes");
+        ASSERT_EQ(task.endUpdate(), 1);
+        RouterUpnpDBUserWriter writer(std::string(report.szBrand) + "/m/");
+        ASSERT_TRUE(writer.SetMaxRule(5) && writer.Sync());
+        std::filesystem::remove("/etc/portforward/router.conf");
+        if (report.blSettings) {
+            Write("/etc/portforward/router.conf", "[10.0.0.1]\nbrand=mine\n");
+        }
+        Write("/usr/tavo/bin/curl",
+              "#!/bin/sh\nprintf '%s\\n' \"$@\" > /tmp/curl.args\nexit " + std::to_string(report.nCurl) + "\n");
+        chmod("/usr/tavo/bin/curl", 0755);
+        std::filesystem::remove("/tmp/curl.args");
+        EXPECT_EQ(TLibUploadTestUpnpCompatibilityFailResult(), report.nCurl == 0 ? 0 : -1);
+        EXPECT_EQ(Logged("update upnp router info failed"), report.nCurl != 0);
+
+        const std::string szArgs = Read("/tmp/curl.args");
+        const size_t nStart = szArgs.find("uploadedfile=@") + 14;
+        const std::string szArchive = szArgs.substr(nStart, szArgs.find(';', nStart) - nStart);
+        const std::string szStem = std::string("/tmp/") + report.szArchive + "_";
+        EXPECT_TRUE(szArchive.starts_with(szStem) && szArchive.ends_with(".tgz")) << szArchive;
+        EXPECT_EQ(szArchive.find_first_not_of("0123456789", szStem.size()), szArchive.size() - 4) << szArchive;
+        EXPECT_TRUE(szArgs.starts_with("--digest\n-u\ntavoreportuser:rtrsubmit417\n-F\n"));
+        EXPECT_NE(szArgs.find(";filename=" + szArchive + "\n"), std::string::npos);
+        ASSERT_EQ(TLIBCSystem(("tar -tzf '" + szArchive + "' > /tmp/names && tar -xOzf '" + szArchive +
+                               "' etc/portforward/router.conf > /tmp/sent")
+                                  .c_str()),
+                  0);
+        EXPECT_EQ(Read("/tmp/names"),
+                  "etc/portforward/router.conf\ntmp/upnp_test.progress\nvar/tmp/upnp_portmap.status\n"
+                  "var/log/router.log\ntmp/pfStatusRule\n");
+        EXPECT_NE(Read("/tmp/sent").find("support_router_upnp=\"yes\""), std::string::npos);
+        EXPECT_EQ(Read("/etc/portforward/router.conf"),
+                  report.blSettings ? "[10.0.0.1]\nbrand=mine\n" : Read("/tmp/sent"));
+        EXPECT_FALSE(std::filesystem::exists("/tmp/owned"));
+        std::filesystem::remove(szArchive);
+    }
+    gSzGateway.clear();
+    Write("/etc/portforward/router.conf", "[10.0.0.1]\nbrand=mine\n");
+    EXPECT_EQ(TLibUploadTestUpnpCompatibilityFailResult(), -1);
+    EXPECT_TRUE(Logged("TLibGetGatewayIP() failed"));
+    EXPECT_EQ(Read("/etc/portforward/router.conf"), "[10.0.0.1]\nbrand=mine\n");
+}
+
+TEST_F(RouterTests, PortVerdicts) {
+    __tag_TAVO_ROUTER_RULE rgRules[7] = {};
+    for (int i = 0; i < 7; ++i) {
+        rgRules[i].enTestStatus = 9;
+        snprintf(rgRules[i].szRouterPort, sizeof(rgRules[i].szRouterPort), "%d", 5000 + i);
+    }
+    auto enErr = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
+    EXPECT_EQ(TLibTestRules(1, nullptr, &enErr, true), -1);
+    EXPECT_EQ(TLibTestRules(-1, rgRules, &enErr, true), -1);
+    EXPECT_TRUE(Logged("Bad parameter, 0 > nRules=-1"));
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
+    EXPECT_EQ(TLibTestRules(7, rgRules, &enErr, true), -1);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_NONE);
+    EXPECT_TRUE(Logged("TLibTestRules() has not been initialized, call TLibTestRulesInit() before TLibTestRules()"));
+    Write("/tmp/pfStatusRule", "");
+    mClient.nTester = -1;
+    EXPECT_EQ(TLibTestRules(7, rgRules, &enErr, true), -1);
+    EXPECT_EQ(rgRules[0].enTestStatus, 9);
+    mClient.nTester = 0;
+    mClient.rgVerdicts = {0, 1, 2, 3, 4, 5, 9};
+    EXPECT_EQ(TLibTestRules(7, rgRules, &enErr, true), 0);
+    const int rgWanted[] = {1, 0, 2, 3, 3, 0, 1};
+    for (int i = 0; i < 7; ++i) {
+        EXPECT_EQ(rgRules[i].enTestStatus, rgWanted[i]) << i;
+    }
+    EXPECT_TRUE(Logged("router_prots [5001] = UNKNOWN"));
+    EXPECT_TRUE(Logged("router_prots [5005] = NOLISTEN"));
+    EXPECT_TRUE(Logged("[6] enStatus=9 is non-support enum case"));
+    EXPECT_EQ(TLibTestRules(0, rgRules, &enErr, true), 0);
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    EXPECT_EQ(TLibTestRules(7, rgRules, &enErr, true), -1);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_CONFLICT);
+    TLibTavoPortMapUnLock();
+}
+
+}  // namespace
