@@ -74,6 +74,10 @@ def add(key, client, port, lease, text):
         return fault(402)
     if key in TABLE and TABLE[key][0] != client:
         return fault(718)
+    if FAULT == "refuses_again" and COUNT.get("DeletePortMapping"):
+        return fault(501)
+    if FAULT == "says_full_at_32" and len(TABLE) >= 32:
+        return fault(728)
     if not (FAULT == "full_at_32" and len(TABLE) >= 32) and FAULT != "keeps_nothing":
         TABLE[key] = (client, port, min(lease, 60) if FAULT == "lease_cut" else lease, text)
     return answer("AddPortMapping")
@@ -92,6 +96,8 @@ def act(action, args):
         return answer(action, **entry(key)) if key in TABLE else fault(714)
     if action == "DeletePortMapping" and FAULT == "gives_nothing_back":
         return fault(606)
+    if action == "DeletePortMapping" and FAULT == "deletes_nothing":
+        return answer(action)
     if action == "DeletePortMapping":
         return answer(action) if TABLE.pop(key, None) else fault(714)
     return add(key, args["NewInternalClient"], int(args["NewInternalPort"]), int(args["NewLeaseDuration"]),
@@ -100,6 +106,7 @@ def act(action, args):
 
 class Handler(BaseHTTPRequestHandler):
     protocol_version = "HTTP/1.1"
+    wbufsize = 65536  # an answer in one piece: in two, the second waits for the acknowledgement of the first
 
     def log_message(self, *args):
         pass
@@ -142,6 +149,9 @@ class Handler(BaseHTTPRequestHandler):
         action = self.headers["SOAPAction"].strip('"').split("#")[1]
         COUNT[action] = COUNT.get(action, 0) + 1
         body = self.rfile.read(int(self.headers["Content-Length"])).decode()
+        if len(TABLE) >= 10 and (
+                FAULT == "silent_at_10" or (FAULT == "silent_adds_at_10" and action == "AddPortMapping")):
+            time.sleep(60)
         if FAULT == "late_reply" and action == "AddPortMapping":
             time.sleep(8)
         time.sleep(max(0, HANG_UNTIL - time.monotonic()))

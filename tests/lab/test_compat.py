@@ -6,7 +6,7 @@ import subprocess
 import unittest
 
 import homelab
-from homelab import BOX, BUILD, GATEWAY, LAN2, WAN, wait_for
+from homelab import BOX, BUILD, LAN2, wait_for
 
 LAB = None
 FILES = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule")
@@ -59,7 +59,78 @@ class Compat(unittest.TestCase):
             self.assertFalse(os.path.exists(RULES))
         self.assertEqual(before, {("tcp", 24501): (BOX, 5001), ("tcp", 24502): (LAN2, 24502),
                                   ("tcp", 24503): (BOX, 5002)})
-        print(answer)
+
+    # fault, mappings asked for, the step that fails, the count, mappings that the router keeps afterwards
+    table = (
+        ("none", 5, "", 5, 0),
+        ("only_permanent", 5, "", 5, 0),
+        ("full_at_32", 60, "", 32, 0),
+        ("says_full_at_32", 60, "", 32, 0),
+        ("keeps_nothing", 5, "upnp_add", 0, 0),
+        ("action_failed_501", 5, "upnp_add", 0, 0),
+        ("silent_at_10", 60, "upnp_add", 0, 10),
+        ("deletes_nothing", 5, "upnp_delete", 5, 5),
+        ("refuses_again", 5, "upnp_readd1", 5, 0),
+    )
+
+    def test_routers_that_lie(self):
+        for fault, rules, failed, count, left in self.table:
+            with self.subTest(fault=fault):
+                LAB.start_scripted(fault)
+                answer = run(rules)
+                self.assertEqual((answer["failed"], answer["count"]), (failed, count))
+                self.ended()
+                self.assertEqual(len(LAB.scripted()["table"]), left)
+                self.assertEqual([path for path in FILES if not os.path.exists(path)], [])
+                LAB.end(LAB.router)
+
+    def test_what_the_rules_have_is_a_part_of_the_limit(self):
+        LAB.start_scripted("full_at_32")
+        LAB.save("1,1,tcp,24501,5001", "2,1,tcp,6001,5002")
+        answer = run(60)
+        self.assertEqual((answer["failed"], answer["count"]), ("", 32))
+        self.assertEqual(sorted(row[1] for row in LAB.scripted()["table"]), [6001, 24501])
+
+    def stop(self):
+        """As the library ends a test from another process."""
+        LAB.run("box", "/usr/tavo/bin/tavoupnptest -t >/dev/null 2>&1 &")
+        for pid in test_daemon():
+            os.kill(pid, signal.SIGHUP)
+        for path in FILES:
+            if os.path.exists(path):
+                os.unlink(path)
+
+    def test_stop_ends_a_test_that_hangs(self):
+        for fault, left in (("silent_adds_at_10", 0), ("silent_at_10", 10)):
+            with self.subTest(fault=fault):
+                LAB.start_scripted(fault)
+                caller = start(60)
+                wait_for(lambda: len(LAB.scripted()["table"]) == 10, 10, "the router has become silent")
+                self.stop()
+                self.ended(3)
+                self.assertEqual(len(LAB.scripted()["table"]), left)
+                self.assertNotEqual(caller.wait(5), 0)
+                self.assertEqual([path for path in FILES if os.path.exists(path)], [])
+                LAB.end(LAB.router)
+
+    def test_terminated_and_killed(self):
+        """Of the daemon's two processes either takes care of the end of the other."""
+        LAB.start_scripted("silent_adds_at_10")
+        for how, which, left in ((signal.SIGTERM, (0,), 0), (signal.SIGTERM, (1,), 0), (signal.SIGKILL, (0,), 0),
+                                 (signal.SIGKILL, (1,), 0), (signal.SIGKILL, (0, 1), 10)):
+            with self.subTest(how=how, which=which):
+                caller = start(60)
+                wait_for(lambda: len(LAB.scripted()["table"]) == 10, 10, "some mappings are there")
+                pids = sorted(test_daemon())
+                for index in which:
+                    os.kill(pids[index], how)
+                self.ended()
+                self.assertEqual(len(LAB.scripted()["table"]), left)
+                if not left:
+                    self.assertEqual(json.loads(caller.communicate(timeout=5)[0])["failed"], "upnp_add")
+                LAB.end(caller)
+        self.assertEqual(run(3)["failed"], "")  # the next one cleans up
+        self.assertEqual(LAB.scripted()["table"], [])
 
 
 def prepare(lab):

@@ -1,11 +1,13 @@
-// The IGD client against hostile answers, and Reconcile against a router in memory.
+// The IGD client against hostile answers, and Reconcile and the test mappings against a router in memory.
 #include <gtest/gtest.h>
 
 #include <algorithm>
 #include <map>
+#include <set>
 #include <tuple>
 
 #include "daemons/common/Reconcile.h"
+#include "daemons/common/TestMappings.h"
 #include "upnp/Igd.h"
 #include "upnp/Ssdp.h"
 
@@ -298,6 +300,128 @@ TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {
     EXPECT_EQ(result.rgStatus.front().second, "timeout");
     EXPECT_EQ(result.nTransport, tavo::kRouterTimeout);
     EXPECT_EQ(router.mMapTable.size(), 1U);
+}
+
+// A router under test: some ports conflict, and some answers are lost after the work was done.
+class OddRouter : public MemoryRouter {
+public:
+    int Add(const RouterMapping& mapping) override {
+        if (mSetConflicts.contains(mapping.nRouterPort)) {
+            return tavo::kRouterConflict;
+        }
+        for (const auto& [key, entry] : mMapTable) {  // as strict as any: no two lead to one port of the box
+            if (key.second != mapping.nRouterPort && entry.nBoxPort == mapping.nBoxPort && entry.szClient == kBox) {
+                return 501;
+            }
+        }
+        return Lose(MemoryRouter::Add(mapping));
+    }
+    int Remove(const std::string& szProtocol, uint16_t nPort) override {
+        return Lose(MemoryRouter::Remove(szProtocol, nPort));
+    }
+    int Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+        return Lose(MemoryRouter::Get(szProtocol, nPort, mapping));
+    }
+    std::set<uint16_t> mSetConflicts;
+    int mNLoseEvery = 0;
+    bool mBlSilent = false;
+
+private:
+    int Lose(int nCode) {
+        return mBlSilent || (mNLoseEvery != 0 && ++mNAnswers % mNLoseEvery == 0) ? tavo::kRouterTimeout : nCode;
+    }
+    int mNAnswers = 0;
+};
+
+std::vector<tavo::TestRule> TestRules(uint16_t nFirst, int nRules) {
+    std::vector<tavo::TestRule> rgRules;
+    for (int i = 0; i < nRules; ++i) {
+        rgRules.push_back({static_cast<uint16_t>(nFirst + i), static_cast<uint16_t>(nFirst + i), false, ""});
+    }
+    return rgRules;
+}
+
+std::vector<int> Ports(const OddRouter& router, const char* szPrefix) {
+    std::vector<int> rgPorts;
+    for (const auto& [key, mapping] : router.mMapTable) {
+        if (mapping.szDescription.starts_with(szPrefix)) {
+            rgPorts.push_back(key.second * 100 + mapping.nBoxPort);
+        }
+    }
+    return rgPorts;
+}
+
+const auto kGoOn = [] { return false; };
+
+TEST(TestMappings, TakeOnlyWhatNobodyHasAndLeaveTheTableAsItWas) {
+    for (const int nListCode : {static_cast<int>(tavo::kRouterOk), 401}) {
+        for (const int nLoseEvery : {0, 3}) {
+            SCOPED_TRACE(nListCode + nLoseEvery);
+            OddRouter router;
+            for (const RouterMapping& mapping :
+                 {Entry(11, 1, kBox, "tavo:rule"), Entry(12, 12, "192.168.1.9", "tavotest:12"),
+                  Entry(13, 3, kBox, "game")}) {
+                router.mMapTable[{"TCP", mapping.nRouterPort}] = mapping;
+            }
+            const auto mapBefore = router.mMapTable;
+            router.mSetConflicts = {15};
+            router.mNListCode = nListCode;
+            router.mNLoseEvery = nLoseEvery;
+            if (nListCode == tavo::kRouterOk) {
+                router.mMapTable[{"TCP", 40}] = Entry(40, 40, kBox, "tavotest:40");  // of one that was killed
+            }
+            tavo::TestMappings test(router, kBox, TestRules(10, 4), [](uint16_t nPort) { return nPort != 16; });
+            EXPECT_TRUE(test.Add(kGoOn));
+            const auto rgMade = Ports(router, "tavotest:");
+            const std::vector<int> rgWanted = {1010, 1212, 1414, 1717, 1818};
+            if (nListCode == tavo::kRouterOk) {
+                EXPECT_EQ(rgMade, rgWanted);
+            }
+            EXPECT_TRUE(test.Readd(kGoOn));
+            EXPECT_TRUE(test.Change(kGoOn));
+            if (nListCode == tavo::kRouterOk) {
+                EXPECT_EQ(Ports(router, "tavotest:"), (std::vector<int>{1014, 1212, 1417, 1718, 1810}));
+            }
+            EXPECT_TRUE(test.Remove(kGoOn));
+            EXPECT_EQ(Ports(router, ""), [&] {
+                OddRouter before;
+                before.mMapTable = mapBefore;
+                return Ports(before, "");
+            }());
+        }
+    }
+}
+
+TEST(TestMappings, NeverTouchAPortThatBecameAnotherHosts) {
+    OddRouter router;
+    tavo::TestMappings test(router, kBox, TestRules(10, 3), [](uint16_t) { return true; });
+    ASSERT_TRUE(test.Add(kGoOn));
+    router.mMapTable[{"TCP", 11}].szClient = "192.168.1.9";  // the router restarted, and another host was faster
+    EXPECT_TRUE(test.Remove(kGoOn));
+    EXPECT_EQ(Ports(router, ""), std::vector<int>{1111});
+}
+
+TEST(TestMappings, ARouterThatFallsSilentFailsSoon) {
+    for (bool (tavo::TestMappings::*pfnStep)(const std::function<bool()>&) :
+         {&tavo::TestMappings::Add, &tavo::TestMappings::Readd, &tavo::TestMappings::Change,
+          &tavo::TestMappings::Remove}) {
+        OddRouter router;
+        tavo::TestMappings test(router, kBox, TestRules(10, 60), [](uint16_t) { return true; });
+        ASSERT_TRUE(test.Add(kGoOn));
+        router.mBlSilent = true;
+        router.mNListCode = tavo::kRouterTimeout;
+        router.mNCalls = 0;
+        EXPECT_FALSE((test.*pfnStep)(kGoOn));
+        EXPECT_LE(router.mNCalls, 4);
+    }
+}
+
+TEST(TestMappings, OneThatIsKeptIsChangedToo) {
+    OddRouter router;
+    tavo::TestMappings test(router, kBox, TestRules(10, 1), [](uint16_t) { return true; });
+    ASSERT_TRUE(test.Add(kGoOn));
+    EXPECT_TRUE(test.Change(kGoOn));
+    EXPECT_EQ(Ports(router, ""), std::vector<int>{1011});
 }
 
 }  // namespace

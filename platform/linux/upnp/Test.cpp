@@ -11,18 +11,12 @@
 
 #include "core/Border.h"
 #include "core/TextFile.h"
-#include "portforward/ConfList.h"
+#include "porttest/PortTest.h"
 #include "tavo/log.h"
 #include "tavo/porttest.h"
 #include "tavo/upnptest.h"
 #include "upnp/Known.h"
 #include "upnp/TestRules.h"
-
-// The tester may be left out of a platform; then the router's table is the judge.
-extern "C" {
-extern __typeof__(TavoPortConnTestInit) TavoPortConnTestInit __attribute__((weak));
-extern __typeof__(TavoPortConnTest) TavoPortConnTest __attribute__((weak));
-}
 
 namespace {
 
@@ -37,7 +31,6 @@ constexpr int kFindMilliseconds = 8000;
 constexpr int kSilentAnswers = 2;          // in a row, before the router is given up
 constexpr size_t kCheckedFromOutside = 4;  // a checker is a guest's host: few questions
 constexpr int kMostLimitSeconds = 600;
-constexpr int kPlainTest = 1;
 constexpr mode_t kMarkerMode = 0644;
 
 int gNLimitSeconds = 60;
@@ -117,36 +110,20 @@ int CountHeld() {
     return nHeld;
 }
 
-bool MakeMarker() {
-    if (&TavoPortConnTestInit != nullptr) {
-        return TavoPortConnTestInit() >= 0;
-    }
-    return TLIBCFileTouch(tavo::kPortTestMarker) == 0;
-}
-
-// What the checker outside says of some of the test's ports; empty when nobody was asked, or nobody could tell.
+// What the checker outside says of some of the test's ports, on which the daemon listens; empty when nobody was
+// asked, or nobody could tell.
 std::vector<int> AskOutside(const std::vector<TestRule>& rgKept) {
-    std::vector<tavo::Section> rgSections;
-    for (size_t i = 0; i < rgKept.size() && rgSections.size() < kCheckedFromOutside;
-         i += std::max<size_t>(1, rgKept.size() / kCheckedFromOutside)) {
-        rgSections.push_back({std::to_string(rgSections.size() + 1),
-                              {{"service", "UPnP test"},
-                               {"protocol name", "tcp"},
-                               {"r_port", std::to_string(rgKept[i].nRouterPort)},
-                               {"s_port", std::to_string(rgKept[i].nBoxPort)},
-                               {"enabled", "1"}}});
+    std::vector<tavo::PortQuestion> rgQuestions;
+    const size_t nStride = std::max<size_t>(1, rgKept.size() / kCheckedFromOutside);
+    for (size_t i = 0; i < rgKept.size() && rgQuestions.size() < kCheckedFromOutside; i += nStride) {
+        rgQuestions.push_back({{"TCP", rgKept[i].nRouterPort, rgKept[i].nBoxPort}});
     }
-    const tavo::ConfList pRules = tavo::MakeConfList(rgSections);
-    std::vector<TAVO_PORT_STATUS> rgStatus(rgSections.size());
     std::vector<int> rgVerdicts;
-    if (&TavoPortConnTest == nullptr || pRules == nullptr ||
-        TavoPortConnTest(pRules.get(), kPlainTest, rgStatus.data(), static_cast<int>(rgStatus.size())) < 0) {
-        return rgVerdicts;
-    }
-    for (const TAVO_PORT_STATUS& status : rgStatus) {
-        if (status.enStatus == TAVO_PORT_OPEN || status.enStatus == TAVO_PORT_REFUSED ||
-            status.enStatus == TAVO_PORT_TIMEOUT) {
-            rgVerdicts.push_back(status.enStatus);
+    const std::vector<tavo::PortVerdict> rgAll = tavo::TestPorts(rgQuestions);
+    for (size_t i = 0; i < rgAll.size(); ++i) {
+        Log(std::to_string(rgQuestions[i].mapping.nRouterPort) + "/tcp: " + rgAll[i].szReason);
+        if (rgAll[i].enStatus != TAVO_PORT_UNKNOWN && rgAll[i].enStatus != TAVO_PORT_NOLISTEN) {
+            rgVerdicts.push_back(rgAll[i].enStatus);
         }
     }
     return rgVerdicts;
@@ -191,7 +168,7 @@ int TestPorts(bool blAdded) {
     if (rgKept.empty() || !tavo::IsTestDaemonAlive()) {
         return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
     }
-    if (TLIBCFileExist(tavo::kPortTestMarker) == 0 && !MakeMarker()) {
+    if (TLIBCFileExist(tavo::kPortTestMarker) == 0 && TavoPortConnTestInit() < 0) {
         return -1;
     }
     const std::vector<int> rgVerdicts = AskOutside(rgKept);
@@ -235,7 +212,7 @@ int TAVOUPnPAddTest(int nRules) {
             return -1;
         }
         // A report of a test that ends early is made of the same files as any other.
-        MakeMarker();
+        TavoPortConnTestInit();
         return TLIBCExec(kTestProgram, "--debug", "-p", nullptr, nullptr);
     });
 }
@@ -246,10 +223,7 @@ int TAVOUPnPCountMaxRule() {
 
 int TAVOUPnPDeletetest() {
     return AtBorder(-1, [] {
-        char szWord[16] = {};
-        const bool blEnd =
-            TLIBCFileGetKeyValue(tavo::kTestProgress, tavo::kStepTerminal, szWord, sizeof(szWord), 0) >= 1 &&
-            szWord == std::string(tavo::kWordProcessing);
+        const bool blEnd = tavo::IsStepUnderWay(tavo::kStepTerminal);
         return tavo::SendTestOrder(blEnd ? tavo::kOrderEnd : tavo::kOrderDelete) ? 0
                                                                                  : Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
     });
@@ -262,7 +236,7 @@ int TAVOUPnPSetupTest(int nLimitSeconds, int nFlags) {
                 return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
             }
             gNLimitSeconds = std::min(nLimitSeconds, kMostLimitSeconds);
-            return MakeMarker() ? 0 : -1;
+            return TavoPortConnTestInit() < 0 ? -1 : 0;
         },
         0);
 }

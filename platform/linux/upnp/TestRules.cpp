@@ -12,6 +12,7 @@
 #include <charconv>
 #include <chrono>
 #include <cstdio>
+#include <cstring>
 
 #include "core/Descriptor.h"
 #include "portforward/ConfList.h"
@@ -74,6 +75,12 @@ int ShowsRule(Router& router, const TestRule& rule, const std::string& szBox, bo
         blShown = nCode == kRouterOk && entry.szClient == szBox && entry.nBoxPort == rule.nBoxPort && entry.blEnabled;
     }
     return nCode;
+}
+
+bool IsStepUnderWay(const char* szStep) {
+    char szWord[16] = {};
+    return TLIBCFileGetKeyValue(kTestProgress, szStep, szWord, sizeof(szWord), 0) >= 1 &&
+           std::strcmp(szWord, kWordProcessing) == 0;
 }
 
 bool IsTestDaemonAlive() {

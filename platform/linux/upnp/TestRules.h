@@ -51,6 +51,9 @@ TAVO_PLATFORM_API bool IsTestMapping(const RouterMapping& entry, const std::stri
 // Whether the router shows the mapping of a rule as the box's own. Below 0: it did not answer.
 TAVO_PLATFORM_API int ShowsRule(Router& router, const TestRule& rule, const std::string& szBox, bool& blShown);
 
+// Whether the progress file says that a step is being worked at.
+TAVO_PLATFORM_API bool IsStepUnderWay(const char* szStep);
+
 // Whether the daemon in test mode runs.
 TAVO_PLATFORM_API bool IsTestDaemonAlive();
 // Gives an order; false when there is no daemon to take it.

@@ -139,6 +139,7 @@ bool TestMappings::Add(const Stop& fnStop) {
     CleanUp(fnStop);
     std::vector<TestRule*> rgpTried;
     for (TestRule& rule : mRgRules) {
+        rule.blKept = false;
         if (step.guard.IsOver() || step.nRefused >= kRefusalsOfAFullTable) {
             rule.szResult = kUntried;
             continue;

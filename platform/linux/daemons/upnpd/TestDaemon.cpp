@@ -5,16 +5,22 @@
 #include <netinet/in.h>
 #include <poll.h>
 #include <sys/file.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <syslog.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
-#include <cstring>
+#include <iterator>
+
+extern "C" {  // this header leaves it out
+#include <sys/pidfd.h>
+}
 
 #include "core/TextFile.h"
 #include "daemons/common/Wanted.h"
@@ -53,14 +59,14 @@ void Log(const std::string& szText) {
     TAVOWriteLog(szText.c_str(), 1, 1);
 }
 
-}  // namespace
-
 // A progress file that was taken away belongs to a test that is over: it is not made anew.
-void TestDaemon::Report(const char* szStep, const char* szWord) const {
+void Report(const char* szStep, const char* szWord) {
     if (TLIBCFileExist(kTestProgress) == 1 && TAVOUpnpReportTestProgress(szStep, szWord, 0) != 0) {
         syslog(LOG_ERR, "cannot report %s of %s", szWord, szStep);
     }
 }
+
+}  // namespace
 
 bool TestDaemon::TakeLock() {
     mFdLock.Reset(open(kLockFile, O_RDWR | O_CREAT | O_CLOEXEC, kPrivateMode));
@@ -181,23 +187,20 @@ void TestDaemon::WriteResults() const {
     }
 }
 
-// Does one step. False: it failed, and so has the test.
+// Does one step. False: it failed, and so has the test; End() says so.
 bool TestDaemon::Work(const char* szStep, bool (TestMappings::*pfnStep)(const std::function<bool()>&)) {
     const auto fnStop = [this] { return IsSignalled() || IsEndOrdered(); };
     mPIgd->SetStop(fnStop);
     const bool blDone = ((*mPMappings).*pfnStep)(fnStop);
     if (fnStop()) {
-        mSzFailed = szStep;
         return false;
     }
     WriteResults();
     Log(std::string(szStep) + (blDone ? " is done" : " failed"));
-    if (!blDone) {
-        mSzFailed = szStep;
-        return false;
+    if (blDone) {
+        Report(szStep, kWordFinished);
     }
-    Report(szStep, kWordFinished);
-    return true;
+    return blDone;
 }
 
 // False: the test is over.
@@ -231,42 +234,35 @@ bool TestDaemon::Withdraw() {
 
 // The word on what was under way comes last: who reads it finds the router as it was before.
 void TestDaemon::End() {
-    const bool blOrdered = IsEndOrdered();
     const bool blGone = mPMappings == nullptr || Withdraw();
     if (!blGone) {
         syslog(LOG_ERR, "the router did not take all test mappings away; the next test tries it again");
     }
     RemoveTestRules();
     unlink(kTestSocket);
-    if (mSzFailed != nullptr) {
-        Report(mSzFailed, kWordFailed);
-        if (std::strcmp(mSzFailed, kStepReadd) == 0) {
-            Report(kStepChange, kWordFailed);
+    for (const char* szStep : {kStepAdd, kStepDelete, kStepReadd, kStepChange}) {
+        if (IsStepUnderWay(szStep)) {
+            Report(szStep, kWordFailed);
         }
     }
-    if (blOrdered) {
+    if (IsStepUnderWay(kStepTerminal)) {
         Report(kStepTerminal, blGone ? kWordFinished : kWordFailed);
     }
 }
 
-// From the first step to the last order.
-void TestDaemon::LeadToEnd() {
-    mSzFailed = kStepAdd;
-    if (!OpenSocket() || !FindRouter()) {
-        return;
+// From the first step to the last order. False: a step failed.
+bool TestDaemon::LeadToEnd() {
+    if (!OpenSocket() || !FindRouter() || !Work(kStepAdd, &TestMappings::Add)) {
+        return false;
     }
-    if (!Work(kStepAdd, &TestMappings::Add)) {
-        return;
-    }
-    mSzFailed = nullptr;
     std::string szOrder = NextOrder();
     while (Obey(szOrder)) {
         szOrder = NextOrder();
     }
+    return szOrder.empty() || szOrder == kOrderEnd;
 }
 
-int TestDaemon::Run() {
-    openlog("upnpd", LOG_PID, LOG_DAEMON);
+int TestDaemon::RunTest() {
     rlimit limit = {};
     if (getrlimit(RLIMIT_NOFILE, &limit) == 0) {
         limit.rlim_cur = limit.rlim_max;  // one for each port that is held
@@ -277,9 +273,44 @@ int TestDaemon::Run() {
         Report(kStepAdd, kWordFailed);
         return 1;
     }
-    LeadToEnd();
+    const bool blDone = LeadToEnd();
     End();
-    return mSzFailed == nullptr ? 0 : 1;
+    return blDone ? 0 : 1;
+}
+
+// Waits for the process that tests, and ends in its place what it could not end.
+int TestDaemon::WatchOver(pid_t pid) {
+    const Descriptor fdEnd(pidfd_open(pid, 0));
+    pollfd rgWaiting[] = {{mSignals.Fd(), POLLIN, 0}, {fdEnd.Get(), POLLIN, 0}};
+    while (fdEnd.Get() >= 0 && rgWaiting[1].revents == 0) {
+        poll(rgWaiting, std::size(rgWaiting), -1);
+        if (IsSignalled() && rgWaiting[1].revents == 0) {
+            kill(pid, SIGTERM);
+        }
+    }
+    int nStatus = 0;
+    if (waitpid(pid, &nStatus, 0) == pid && WIFEXITED(nStatus)) {
+        return WEXITSTATUS(nStatus);
+    }
+    syslog(LOG_ERR, "the test was killed; its mappings are taken away");
+    if (TakeLock() && FindRouter()) {
+        End();
+    }
+    return 1;
+}
+
+int TestDaemon::Run() {
+    openlog("upnpd", LOG_PID, LOG_DAEMON);
+    const pid_t pidWatch = getpid();
+    const pid_t pid = fork();
+    if (pid > 0) {
+        return WatchOver(pid);
+    }
+    prctl(PR_SET_PDEATHSIG, pid == 0 ? SIGTERM : 0);
+    if (pid == 0 && getppid() != pidWatch) {
+        return 1;
+    }
+    return RunTest();
 }
 
 }  // namespace tavo

@@ -1,9 +1,12 @@
 // upnpd in its test mode: tests by orders what a router does with mappings, and leaves none behind.
 // Relies on TestMappings for the table, on TestRules for the orders, and on the IGD client.
 // Promises: each step ends with its word in the progress file; the mappings are gone when it has ended,
-// however it ends, and what a killed one has left goes at the next start; a signal ends it within three
-// seconds; so do some minutes without an order. The daemon of the rules is not touched by it.
+// however it ends: of its two processes one watches over the other, and what both leave, killed at once, goes
+// at the next start; a signal ends it within three seconds, some minutes without an order end it as well. The
+// daemon of the rules is not touched by it.
 #pragma once
+
+#include <sys/types.h>
 
 #include <functional>
 #include <memory>
@@ -24,11 +27,13 @@ public:
     int Run();
 
 private:
+    int RunTest();
+    int WatchOver(pid_t pid);
     bool TakeLock();
     bool OpenSocket();
     bool FindRouter();
     bool HoldPort(uint16_t nPort);
-    void LeadToEnd();
+    bool LeadToEnd();
     bool Obey(const std::string& szOrder);
     bool Work(const char* szStep, bool (TestMappings::*pfnStep)(const std::function<bool()>&));
     bool IsSignalled();
@@ -38,7 +43,6 @@ private:
     void Answer();
     bool Withdraw();
     void End();
-    void Report(const char* szStep, const char* szWord) const;
     void WriteResults() const;
 
     SignalQueue mSignals;
@@ -49,7 +53,6 @@ private:
     std::vector<Descriptor> mRgFdPorts;
     std::unique_ptr<Igd> mPIgd;
     std::unique_ptr<TestMappings> mPMappings;
-    const char* mSzFailed = nullptr;  // the step that could not be done
 };
 
 }  // namespace tavo
