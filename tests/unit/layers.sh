@@ -9,7 +9,7 @@ forbid() { # FOLDER PATTERN REASON
         exit 1
     fi
 }
-forbid src '(core|portforward|net|upnp|task|daemons)/' "the library knows the platform by its seam only"
+forbid src '(core|portforward|porttest|net|upnp|task|daemons)/' "the library knows the platform by its seam only"
 forbid platform 'libtavoportmap' "the platform stands beneath the library"
-forbid cli '(tavo|core|portforward|net|upnp|task|daemons)/' "callers use the public header only"
+forbid cli '(tavo|core|portforward|porttest|net|upnp|task|daemons)/' "callers use the public header only"
 forbid include 'tavo/' "the public header stands alone"

@@ -14,11 +14,16 @@
 #include <cstring>
 #include <fstream>
 #include <string>
+#include <vector>
+
+#include "tavo/net.h"
 
 namespace tavo {
 
 namespace {
 
+constexpr int kMaxCards = 256;
+constexpr int kUpAndNoLoopback = 2;
 constexpr int kReceiveBuffer = 1 << 20;
 constexpr size_t kMaxRequests = 65536;  // remembered; a flood makes the answer untold
 
@@ -54,6 +59,19 @@ Descriptor OpenPackets() {
     return fd;
 }
 
+// Not only the one that faces the router: a mapping made by hand may lead to any of them.
+std::set<in_addr_t> OwnAddresses() {
+    std::vector<TAVO_NET_CARD> rgCards(kMaxCards);
+    const int nCards = TLIBNetGetInterfaceInfo(rgCards.data(), kMaxCards, kUpAndNoLoopback);
+    std::set<in_addr_t> setOwn;
+    for (int i = 0; i < nCards; ++i) {
+        in_addr address = {};
+        inet_pton(AF_INET, rgCards[static_cast<size_t>(i)].szAddress, &address);
+        setOwn.insert(address.s_addr);
+    }
+    return setOwn;
+}
+
 // A row of the table: "sl local_address rem_address st ...", addresses as HEX:PORT.
 bool IsInTable(const char* szTable, uint16_t nBoxPort, uint16_t nCheckerPort) {
     constexpr unsigned kListening = 0x0A;
@@ -72,7 +90,7 @@ bool IsInTable(const char* szTable, uint16_t nBoxPort, uint16_t nCheckerPort) {
 
 }  // namespace
 
-Arrivals::Arrivals(in_addr local) : mLocal(local), mFdPackets(OpenPackets()) {}
+Arrivals::Arrivals() : mSetOwn(OwnAddresses()), mFdPackets(OpenPackets()) {}
 
 void Arrivals::TakePackets() {
     alignas(iphdr) unsigned char rgPacket[kPacketBytes];
@@ -85,7 +103,7 @@ void Arrivals::TakePackets() {
         std::memcpy(&ip, rgPacket, sizeof(ip));
         const size_t nHeader = ip.ihl * 4U;
         // What this box sends to itself is seen here too.
-        if (from.sll_pkttype == PACKET_HOST && ip.daddr == mLocal.s_addr && ip.saddr != ip.daddr &&
+        if (from.sll_pkttype == PACKET_HOST && mSetOwn.count(ip.daddr) != 0 && ip.saddr != ip.daddr &&
             static_cast<size_t>(nLength) >= nHeader + sizeof(tcp)) {
             std::memcpy(&tcp, rgPacket + nHeader, sizeof(tcp));
             mMapRequests[ntohs(tcp.dest)].insert(ntohs(tcp.source));

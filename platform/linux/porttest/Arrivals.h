@@ -18,8 +18,8 @@ enum class Arrival { kHere, kElsewhere, kUntold };
 
 class Arrivals {
 public:
-    // Watches from now on for what is addressed to the box's own address.
-    explicit Arrivals(in_addr local);
+    // Watches from now on for what is addressed to the box.
+    Arrivals();
     // Whether a TCP connection to this port of the box came from this port of the checker. Its address is
     // not looked at: the checker may itself stand behind a translation, which keeps ports where it can.
     //
@@ -32,7 +32,7 @@ public:
 private:
     void TakePackets();
 
-    in_addr mLocal;
+    std::set<in_addr_t> mSetOwn;  // the box's addresses
     Descriptor mFdPackets;
     bool mBlMissed = false;
     size_t mNRequests = 0;

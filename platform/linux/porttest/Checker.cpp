@@ -4,6 +4,7 @@
 
 #include <arpa/inet.h>
 #include <json/json.h>
+#include <signal.h>
 #include <sys/random.h>
 
 #include <algorithm>
@@ -101,6 +102,29 @@ std::optional<PortFinding> ReadFinding(const Json::Value& jsFinding, const Check
                        static_cast<uint16_t>(jsSource.asInt())};
 }
 
+// TLS writes to its socket in a way that raises SIGPIPE when the other side has gone, which would end a caller that
+// is not prepared for it.
+class WithoutSigpipe {
+public:
+    WithoutSigpipe() {
+        sigemptyset(&mPipe);
+        sigaddset(&mPipe, SIGPIPE);
+        pthread_sigmask(SIG_BLOCK, &mPipe, &mBefore);
+    }
+    ~WithoutSigpipe() {
+        const timespec now = {};
+        while (sigismember(&mBefore, SIGPIPE) == 0 && sigtimedwait(&mPipe, nullptr, &now) > 0) {
+        }
+        pthread_sigmask(SIG_SETMASK, &mBefore, nullptr);
+    }
+    WithoutSigpipe(const WithoutSigpipe&) = delete;
+    WithoutSigpipe& operator=(const WithoutSigpipe&) = delete;
+
+private:
+    sigset_t mPipe;
+    sigset_t mBefore;
+};
+
 }  // namespace
 
 CheckerSettings ReadCheckerSettings() {
@@ -165,6 +189,7 @@ CheckerAnswer Checker::Ask(const std::vector<CheckedPort>& rgPorts, const std::s
     if (!mUrl || !blHeaderText) {
         return None("the port checker's url or token cannot be used ([portcheck] of /etc/tavo/platform.conf)");
     }
+    const WithoutSigpipe guard;
     mHttp.SetLimit(nMilliseconds);
     const HttpAnswer answer =
         mHttp.Post(*mUrl, {"Content-Type: application/json", "Authorization: Bearer " + mSettings.szToken},

@@ -182,7 +182,7 @@ void Test::Run(std::vector<Item>& rgItems) {
             rgAsked.push_back(&item);
         }
     }
-    Arrivals arrivals(mLocal);
+    Arrivals arrivals;
     mResponder.Start();
     for (size_t nFirst = 0; nFirst < rgAsked.size(); nFirst += mNPortsPerRequest) {
         const auto it = rgAsked.begin() + static_cast<std::ptrdiff_t>(nFirst);
