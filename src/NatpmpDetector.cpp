@@ -26,6 +26,7 @@ constexpr char kVersion[] = "natpmp_version";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::TaskUpdate;
 
 // The list must be seen in two polls in a row, so that it is whole, unless it comes with the last one.
 bool WaitForAnnouncements() {
@@ -42,21 +43,21 @@ bool WaitForAnnouncements() {
 }
 
 // The gateway is something else.
-bool IsNoBaseStation(NOS::Task& task) {
+bool IsNoBaseStation(TaskUpdate& record) {
     tavo::lib::SetRunKey(tavo::lib::kNatpmpRunKey, "no");
-    task.setProperty(kSupport, "no");
+    record.Set(kSupport, "no");
     return true;
 }
 
 // Everything between the beginning and the end of the record's update.
-bool Detect(NOS::Task& task, tavo::lib::Hash& pHash, const char* szGatewayIP) {
+bool Detect(TaskUpdate& record, tavo::lib::Hash& pHash, const char* szGatewayIP) {
     unlink(kAnnounced);
     if (TLIBServiceRestart(kService) < 0) {
         LogError("%s:%d call TLIBNetService() error", kFile, __LINE__);
         return false;
     }
     if (!WaitForAnnouncements()) {
-        return IsNoBaseStation(task);
+        return IsNoBaseStation(record);
     }
     pHash.reset(TLIBCSzHashAlloc(tavo::lib::kHashSize));
     if (!pHash) {
@@ -65,21 +66,21 @@ bool Detect(NOS::Task& task, tavo::lib::Hash& pHash, const char* szGatewayIP) {
     }
     if (TLIBCFileGetSection(kAnnounced, szGatewayIP, pHash.get()) < 1) {
         LogError("%s:%d Failed to Get Section [%s], so that target router is not natpmp", kFile, __LINE__, szGatewayIP);
-        return IsNoBaseStation(task);
+        return IsNoBaseStation(record);
     }
     const char* szName = TLIBCSzHashGetValue(pHash.get(), "name");
-    task.setProperty(kUserSettingName, szName == nullptr ? "" : szName);
-    task.setProperty(kBrand, kAirPort);
-    task.setProperty(kModel, "");
-    task.setProperty(kVersion, "");
+    record.Set(kUserSettingName, szName == nullptr ? "" : szName);
+    record.Set(kBrand, kAirPort);
+    record.Set(kModel, "");
+    record.Set(kVersion, "");
 
     std::string szSupport;
     if (!RouterUpnpDB(kAirPort, "", "").GetSupport(szSupport)) {
         LogError("%s:%d Failed to query router upnp db", kFile, __LINE__);
-        task.setProperty(kSupport, "no");
+        record.Set(kSupport, "no");
         return false;
     }
-    task.setProperty(kSupport, szSupport.c_str());
+    record.Set(kSupport, szSupport.c_str());
     return true;
 }
 
@@ -110,8 +111,9 @@ bool NatpmpDetector::Start(const char* szGatewayIP) {
             LogError("%s:%d memory is not enough", kFile, __LINE__);
             return false;
         }
-        const tavo::lib::TaskUpdate update(*pTask);
-        return Detect(*pTask, pHash, szGatewayIP);
+        TaskUpdate record(*pTask);
+        const bool blDetected = Detect(record, pHash, szGatewayIP);
+        return record.End() && blDetected;
     });
 }
 

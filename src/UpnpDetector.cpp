@@ -22,6 +22,7 @@ constexpr char kPfPath[] = "upnp_pfpath";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::TaskUpdate;
 
 bool HasDescription(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
     if (!tavo::lib::IsPathPart(szBrand) || !tavo::lib::IsPathPart(szModel) || !tavo::lib::IsPathPart(szVersion)) {
@@ -33,7 +34,7 @@ bool HasDescription(const std::string& szBrand, const std::string& szModel, cons
 }
 
 // Publishes the name of the model's description, when that description is here or can be fetched.
-void NotePfPath(NOS::Task& task, std::string szPfPath) {
+void NotePfPath(TaskUpdate& record, std::string szPfPath) {
     std::string szBrand;
     std::string szModel;
     std::string szVersion;
@@ -50,40 +51,40 @@ void NotePfPath(NOS::Task& task, std::string szPfPath) {
             return;
         }
     }
-    task.setProperty(kPfPath, szPfPath.c_str());
+    record.Set(kPfPath, szPfPath.c_str());
 }
 
 // Everything between the beginning and the end of the record's update.
-bool Detect(NOS::Task& task) {
+bool Detect(TaskUpdate& record) {
     TAVOUpnpCleanup();
     if (TAVOUpnpInit(kSearchLimitSeconds, kLocalPort) == 1) {
         tavo::lib::SetRunKey(tavo::lib::kUpnpRunKey, "no");
         LogError("%s:%d init UPnP faild", kFile, __LINE__);
-        task.setProperty(kSupport, "no");
+        record.Set(kSupport, "no");
         return true;
     }
     TAVO_UPNP_GATEWAY_MODEL model = {};
     if (TAVOUpnpGatewayModelGet(&model) != 0) {
-        task.setProperty(kSupport, "no");
+        record.Set(kSupport, "no");
         return true;
     }
-    task.setProperty(kModel, model.szModel);
-    task.setProperty(kBrand, model.szBrand);
-    task.setProperty(kVersion, model.szVersion);
-    task.setProperty(kAble, "yes");
+    record.Set(kModel, model.szModel);
+    record.Set(kBrand, model.szBrand);
+    record.Set(kVersion, model.szVersion);
+    record.Set(kAble, "yes");
 
     RouterUpnpDB db(model.szBrand, model.szModel, model.szVersion);
     std::string szPfPath;
     if (db.GetPfpath(szPfPath) && !szPfPath.empty()) {
-        NotePfPath(task, szPfPath);
+        NotePfPath(record, szPfPath);
     }
     std::string szSupport;
     if (!db.GetSupport(szSupport)) {
         LogError("%s:%d query router upnp db failed", kFile, __LINE__);
-        task.setProperty(kSupport, "no");
+        record.Set(kSupport, "no");
         return false;
     }
-    task.setProperty(kSupport, szSupport.c_str());
+    record.Set(kSupport, szSupport.c_str());
     return true;
 }
 
@@ -108,10 +109,10 @@ bool UpnpDetector::Start() {
         if (!pTask) {
             return false;
         }
-        const tavo::lib::TaskUpdate update(*pTask);
-        const bool blDetected = Detect(*pTask);
+        TaskUpdate record(*pTask);
+        const bool blDetected = Detect(record);
         lock.Release();
-        return blDetected;
+        return record.End() && blDetected;
     });
 }
 

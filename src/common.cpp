@@ -354,7 +354,26 @@ TaskUpdate::TaskUpdate(NOS::Task& task) : mTask(task) {
 }
 
 TaskUpdate::~TaskUpdate() {
-    mTask.endUpdate();
+    if (!mBlEnded) {
+        mTask.remove();
+        End();
+    }
+}
+
+void TaskUpdate::Set(const char* szName, const char* szValue) {
+    if (mTask.setProperty(szName, szValue) == 0) {
+        throw std::bad_alloc();
+    }
+}
+
+bool TaskUpdate::End() {
+    mBlEnded = true;
+    if (mTask.endUpdate() == 0) {
+        LogError("%s:%d the result of the detection could not be stored[0x%04X %s:%d]", kFile, __LINE__,
+                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
+        return false;
+    }
+    return true;
 }
 
 std::string TaskText(const char* szId, const char* szName) {

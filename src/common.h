@@ -109,7 +109,8 @@ bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule);
 // Sets one of the two run keys of the system settings. False: it could not be written.
 bool SetRunKey(const char* szKey, const char* szValue);
 
-// One update of a task record: emptied and begun here, published with the object's end on every path.
+// One update of a task record: emptied and begun here, published by End(). Without End(), on the way of
+// something thrown, it is published empty: half of a finding would be taken for a whole one.
 class TaskUpdate {
 public:
     explicit TaskUpdate(NOS::Task& task);
@@ -117,8 +118,14 @@ public:
     TaskUpdate(const TaskUpdate&) = delete;
     TaskUpdate& operator=(const TaskUpdate&) = delete;
 
+    // Throws when memory runs out.
+    void Set(const char* szName, const char* szValue);
+    // False, and logged: readers see what the last update published.
+    bool End();
+
 private:
     NOS::Task& mTask;
+    bool mBlEnded = false;
 };
 
 // One text of a record of kTaskOwner's, read anew; empty when there is none.

@@ -1,6 +1,7 @@
 // The entry points with C types: support words, the router lock and the busy state, rule arrays, the
 // router description, router settings, detection, and saving rules. Relies on the library's own classes
 // and the platform. Promises: arguments are checked before any work, locks are given back on every path.
+#include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -391,14 +392,23 @@ bool FillMaxRule(RouterConf& conf) {
 
 constexpr int kNothingStored = 1;
 
+// The file may be in order: what failed is the box, which has no memory or no descriptor left, or its disk.
+bool IsReadFailure(int nErr) {
+    return nErr == TLIBC_ERR_NO_MEMORY || nErr == TLIBC_ERR_OPEN || nErr == TLIBC_ERR_READ;
+}
+
 int FillRouterConf(const char* szGwRouterIP, RouterConf& conf) {
     if (TLIBCFileExist(kRouterConf) != 1) {
         LogError("%s:%d file=%s not exists", kFile, __LINE__, kRouterConf);
         return kNothingStored;
     }
+    TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
     RouterConfReader reader{std::string(szGwRouterIP)};
     bool blExist = false;
     if (reader.IsSectionExist(blExist) == 0) {
+        if (IsReadFailure(TLIBCErrGet())) {
+            return -1;
+        }
         LogError("%s:%d file=%s has wrong format, try to unlink it", kFile, __LINE__, kRouterConf);
         unlink(kRouterConf);
         return kNothingStored;
@@ -671,6 +681,7 @@ bool Detection::RunDetectors(RouterLock& lock) {
     if (pid == 0) {
         std::string szGatewayIP;
         if (GetGatewayIP(szGatewayIP) != 0) {
+            signal(SIGCHLD, SIG_DFL);  // a caller that ignores its children's ends would hide those of ours
             NatpmpDetector().Start(szGatewayIP.c_str());
             _exit(0);
         }
@@ -776,9 +787,12 @@ int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult,
             return Detection(*detectResult, pfnCallback, arg).Run(blLock, lock);
         });
     }
-    if (pfnCallback != nullptr) {
-        pfnCallback(detectResult, arg);
-    }
+    AtBorder(0, [&] {
+        if (pfnCallback != nullptr) {
+            pfnCallback(detectResult, arg);
+        }
+        return 0;
+    });
     if (blDetected) {
         detectResult->nProgress = 100;
     }

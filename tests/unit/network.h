@@ -24,6 +24,7 @@ struct Network {
     int nRouterDbUpdates = 0;
     std::function<void()> fnRouterDbUpdate = [] {};
     std::optional<std::string> szAnnounced;
+    std::function<void()> fnAnnounce;  // what else happens when avahi restarts
 };
 extern Network* gPNetwork;
 

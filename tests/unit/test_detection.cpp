@@ -1,8 +1,10 @@
 // Detection, the detection cache and the router's settings, over the real files and task records; the
 // network and the router are stand-ins that each test scripts.
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <functional>
@@ -10,6 +12,7 @@
 
 #include "libtavoportmap.h"
 #include "network.h"
+#include "stage.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
 #include "tavo/portforward.h"
@@ -66,8 +69,12 @@ int TLIBServiceRestart(const char* szName) {
     if (gPNetwork == nullptr) {
         return Real("TLIBServiceRestart", &TLIBServiceRestart)(szName);
     }
+    const OwnMemory own;
     if (gPNetwork->szAnnounced) {
         Write("/tmp/airport.tcp.local", *gPNetwork->szAnnounced);
+    }
+    if (gPNetwork->fnAnnounce) {
+        gPNetwork->fnAnnounce();
     }
     return strcmp(szName, "avahi") == 0 ? gPNetwork->nServiceRestart : -2;
 }
@@ -131,6 +138,8 @@ protected:
         gPNetwork = nullptr;
         gFnOnSleep = nullptr;
         gFnOnConfSet = nullptr;
+        gFnOnDetectorInit = nullptr;
+        gStage = {};
     }
     static void SetTool(const std::string& szLine) {
         Write(kTool, "#!/bin/sh\necho '" + szLine + "'\n");
@@ -309,6 +318,52 @@ TEST_F(Detection, NatpmpRefusals) {
     EXPECT_TRUE(IsLockFree("/tmp/natpmp_detector.lock"));
 }
 
+TEST_F(Detection, FilesThatOthersPlantedInTmpHoldNobody) {
+    const std::string szLong(3000, 'n');
+    std::string szMany;
+    for (int i = 0; i < 10000; ++i) {
+        szMany += "[10.0." + std::to_string(i / 250) + "." + std::to_string(i % 250) +
+                  "]\nname=" + szLong.substr(0, 99) + "\n";
+    }
+    Write("/tmp/elsewhere", "not for everybody");
+    const std::pair<std::function<void()>, std::string> rgCases[] = {
+        {[] { mkfifo(kAnnounced, 0666); }, "no"},
+        {[] { std::filesystem::create_directory(kAnnounced); }, "no"},
+        {[] { symlink("/tmp/elsewhere", kAnnounced); }, "no"},
+        {[] { symlink("/dev/zero", kAnnounced); }, "no"},
+        {[&] { Write(kAnnounced, szMany + "[192.168.1.1]\nname=" + szLong + "\n"); }, "yes"},
+    };
+    NatpmpDetector detector;
+    for (const auto& [fnPlant, szSupport] : rgCases) {
+        mNetwork.fnAnnounce = fnPlant;
+        EXPECT_TRUE(detector.Start("192.168.1.1"));
+        EXPECT_EQ(detector.GetSupportNatpmp(), szSupport) << &szSupport - &rgCases[0].second;
+        std::filesystem::remove(kAnnounced);
+    }
+    EXPECT_EQ(detector.GetUserSettingName(), szLong);
+    EXPECT_EQ(Read("/tmp/elsewhere"), "not for everybody");
+    for (const bool blPipe : {true, false}) {
+        for (const char* szLock : {"/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock"}) {
+            std::filesystem::remove(szLock);
+            EXPECT_EQ(blPipe ? mkfifo(szLock, 0666) : mkdir(szLock, 0777), 0);
+        }
+        EXPECT_EQ(UpnpDetector().Start(), blPipe);
+        EXPECT_EQ(detector.Start("192.168.1.1"), blPipe);
+    }
+    std::filesystem::remove("/tmp/upnp_detector.lock");
+    std::filesystem::remove("/tmp/natpmp_detector.lock");
+}
+
+TEST_F(Detection, AResultThatCannotBeStoredIsNoSuccess) {
+    gFnOnDetectorInit = [] {
+        std::filesystem::remove_all("/var/lib/tavo/tasks");
+        Write("/var/lib/tavo/tasks", "");
+    };
+    EXPECT_FALSE(UpnpDetector().Start());
+    EXPECT_NE(gLog.back().find("the result of the detection could not be stored["), std::string::npos);
+    EXPECT_TRUE(IsLockFree("/tmp/upnp_detector.lock"));
+}
+
 // ---- the driver ------------------------------------------------------------------------------------------
 
 struct DriverCase {
@@ -455,6 +510,29 @@ TEST_F(Detection, ChildWithoutGatewayReturnsAndLeavesTheLockToItsParent) {
     EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
 }
 
+TEST_F(Detection, CallerWithChildrenOfItsOwnAndOneThatIgnoresTheirEnds) {
+    const pid_t pidOther = fork();
+    if (pidOther == 0) {
+        pause();
+        _exit(7);
+    }
+    mNetwork.nUpnpInit = 1;
+    mNetwork.szAnnounced = "[192.168.1.1]\nname=Den\n";
+    for (const auto pfnHandler : {SIG_DFL, SIG_IGN, +[](int) { waitpid(-1, nullptr, WNOHANG); }}) {
+        std::filesystem::remove_all("/var/lib/tavo/tasks");
+        signal(SIGCHLD, pfnHandler);
+        // Only a status that arrives says that the service has restarted.
+        mNetwork.fnAnnounce = [this] { mNetwork.nServiceRestart = TLIBCSystem("exit 0"); };
+        DetectResult result = {};
+        EXPECT_EQ(TLibDetectRouter(&result, nullptr, nullptr, true), 0);
+        EXPECT_EQ(result.enSupportNatpmp, TAVO_ROUTER_SUPPORT_YES);
+        EXPECT_EQ(kill(pidOther, 0), 0);
+    }
+    signal(SIGCHLD, SIG_DFL);
+    kill(pidOther, SIGKILL);
+    EXPECT_EQ(waitpid(pidOther, nullptr, 0), pidOther);
+}
+
 // ---- the router's settings -------------------------------------------------------------------------------
 
 RouterConf MakeConf(const char* szUpnp, const char* szNatpmp) {
@@ -568,6 +646,78 @@ TEST_F(Detection, SettingsAfterEachFault) {
     gFnOnConfSet = [] { return -1; };
     EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, nullptr, true), -1);
     EXPECT_EQ(Read(kRouterConf), "[192.168.1.1]\nbrand=older\n");
+    // The restore itself fails: the copy stays for the next one.
+    SetUp();
+    Write(kRouterConf, szOld);
+    conf = MakeConf("no", "no");
+    SetTool("");
+    gSzFailRename = kRouterConfBak;
+    EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, nullptr, true), -1);
+    EXPECT_EQ(gLog.back(), "can not save backup file of '/etc/portforward/router.conf.bak'");
+    EXPECT_FALSE(std::filesystem::exists(kRouterConf));
+    EXPECT_EQ(Read(kRouterConfBak), szOld);
+}
+
+// ---- memory that runs out ----------------------------------------------------------------------------------
+
+TEST_F(Detection, MemoryThatRunsOutLosesNoSettings) {
+    const std::string szOld = "[192.168.1.1]\nbrand=\"a brand of some length\"\nuser=me\n";
+    for (const bool blManual : {true, false}) {
+        RouterConf conf = MakeConf(blManual ? "no" : "yes", "no");
+        RunOutOfMemory([&](const auto& fnArm) {
+            Write(kRouterConf, szOld);
+            fnArm();
+            const int nStored = TLibSetRouterConf("192.168.1.1", &conf, nullptr, true);
+            gNGoodAllocations = -1;
+            const std::string szNow = Read(kRouterConf);
+            EXPECT_TRUE(szNow == szOld || nStored == 0 || (!blManual && szNow.empty())) << szNow;
+            EXPECT_EQ(szNow.find("Acme") != std::string::npos, nStored == 0);
+            EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
+            RouterConf read = {};
+            fnArm();
+            const int nRead = TLibGetRouterConf("192.168.1.1", &read, nullptr, true);
+            gNGoodAllocations = -1;
+            EXPECT_TRUE(nRead == (szNow.empty() ? 1 : 0) || (gBlAllocationFailed && nRead == -1)) << nRead;
+            EXPECT_EQ(Read(kRouterConf), szNow);
+            EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+        });
+    }
+}
+
+TEST_F(Detection, MemoryThatRunsOutHalvesNoResult) {
+    gStage.blOn = true;
+    gStage.szFail = "run";
+    mNetwork.szAnnounced = "[192.168.1.1]\nname=\"a name of some length\"\n";
+    const auto fnCheckRecords = [] {
+        UpnpDetector upnp;
+        NatpmpDetector natpmp;
+        const std::string szUpnp = upnp.GetBrand() + upnp.GetModel() + upnp.GetVersion();
+        const std::string szNatpmp = natpmp.GetBrand() + natpmp.GetUserSettingName();
+        EXPECT_EQ(szUpnp, upnp.IsAbleToGetBrandModelVersion() ? "AcmeR11.0" : "");
+        EXPECT_TRUE(szNatpmp == "AirPorta name of some length" || szNatpmp.empty()) << szNatpmp;
+        EXPECT_TRUE(IsLockFree("/tmp/upnp_detector.lock") && IsLockFree("/tmp/natpmp_detector.lock"));
+        std::filesystem::remove_all("/var/lib/tavo/tasks");
+    };
+    RunOutOfMemory([&](const auto& fnArm) {
+        fnArm();
+        const bool blUpnp = UpnpDetector().Start();
+        const bool blNatpmp = NatpmpDetector().Start("192.168.1.1");
+        gNGoodAllocations = -1;
+        EXPECT_EQ(blUpnp, !UpnpDetector().GetSupportUpnp().empty());
+        EXPECT_EQ(blNatpmp, !NatpmpDetector().GetSupportNatpmp().empty());
+        fnCheckRecords();
+    });
+    RunOutOfMemory([&](const auto& fnArm) {
+        const pid_t pidSelf = getpid();
+        DetectResult result = {};
+        fnArm();
+        const int nResult = TLibDetectRouter(&result, nullptr, nullptr, true);
+        gNGoodAllocations = -1;
+        ASSERT_EQ(getpid(), pidSelf);
+        EXPECT_EQ(result.nProgress == 100, nResult == 0);
+        EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+        fnCheckRecords();
+    });
 }
 
 }  // namespace

@@ -339,22 +339,6 @@ TEST_F(Saving, ReportsWhatTheRouterRefused) {
     EXPECT_EQ(szRemap, szLong);
 }
 
-// Calls fnCall with the n-th allocation failing, for every n, alone and with all that follow.
-template <typename Call>
-void RunOutOfMemory(Call fnCall) {
-    for (const bool blOne : {true, false}) {
-        bool blFailed = true;
-        for (long n = 0; blFailed; ++n) {
-            gBlOneFailure = blOne;
-            gBlAllocationFailed = false;
-            fnCall([n] { gNGoodAllocations = n; });
-            gNGoodAllocations = -1;
-            blFailed = gBlAllocationFailed;
-            ASSERT_LT(n, 20000);
-        }
-    }
-}
-
 TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
     std::set<std::string> said;
     std::string szNewRules;

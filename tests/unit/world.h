@@ -1,6 +1,8 @@
 // What the tests share: the log lines of the system log, files at their fixed places, a fake gateway.
 #pragma once
 
+#include <gtest/gtest.h>
+
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -38,6 +40,22 @@ public:
 
     static int nDepth;
 };
+
+// Calls fnCall with the n-th allocation failing, for every n, alone and with all that follow.
+template <typename Call>
+void RunOutOfMemory(Call fnCall) {
+    for (const bool blOne : {true, false}) {
+        bool blFailed = true;
+        for (long n = 0; blFailed; ++n) {
+            gBlOneFailure = blOne;
+            gBlAllocationFailed = false;
+            fnCall([n] { gNGoodAllocations = n; });
+            gNGoodAllocations = -1;
+            blFailed = gBlAllocationFailed;
+            ASSERT_LT(n, 20000);
+        }
+    }
+}
 
 inline void Write(const std::string& szPath, const std::string& szText) {
     std::filesystem::create_directories(std::filesystem::path(szPath).parent_path());

@@ -38,9 +38,7 @@ void CopyOut(const std::string& szText, char* szValue, int nSize) {
 class DirectoryLock {
 public:
     explicit DirectoryLock(const std::string& szPath) {
-        const size_t nSlash = szPath.rfind('/');
-        const std::string szDir = nSlash == std::string::npos ? "." : szPath.substr(0, nSlash + 1);
-        mFd.Reset(open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        mFd.Reset(open(tavo::DirectoryOf(szPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         // Held only for the moment of a replacement; a holder that hangs must not hang everybody.
         for (int i = 0; i < kTries && flock(mFd.Get(), LOCK_EX | LOCK_NB) != 0 && errno == EWOULDBLOCK; ++i) {
             usleep(kTryMicroseconds);

@@ -11,6 +11,7 @@ namespace {
 
 constexpr char kFile[] = "platform/linux/core/Service.cpp";
 constexpr int kNameSize = 128;
+constexpr char kTimeout[] = "timeout -k 2 28 ";  // for who does not heed the first signal, a second one
 
 // Where the system's name differs from the platform's.
 struct Alias {
@@ -50,7 +51,7 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
             return -1;
         }
         if (TLIBCFileExist("/run/systemd/system") == 1) {
-            return TLIBCSystem(("timeout 30 systemctl " + std::string(szSystemdVerb) + " " + szSystem +
+            return TLIBCSystem((std::string(kTimeout) + "systemctl " + szSystemdVerb + " " + szSystem +
                                 ".service >/dev/null 2>&1 </dev/null")
                                    .c_str());
         }
@@ -59,7 +60,7 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
             TLIBCErrSet(TLIBC_ERR_NOT_FOUND, kFile, __LINE__);
             return -1;
         }
-        return TLIBCSystem(("timeout 30 " + szScript + " " + szInitVerb + " >/dev/null 2>&1 </dev/null").c_str());
+        return TLIBCSystem((kTimeout + szScript + " " + szInitVerb + " >/dev/null 2>&1 </dev/null").c_str());
     });
 }
 

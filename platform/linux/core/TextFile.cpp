@@ -224,9 +224,8 @@ private:
 // Where the file really lies: a link keeps being one. In a directory that everybody may write to
 // (/tmp), a link may be a trap: there it is replaced and not followed.
 std::string Resolve(const std::string& szPath) {
-    const std::string szDir = szPath.substr(0, szPath.rfind('/') + 1);
     struct stat status = {};
-    if (stat(szDir.empty() ? "." : szDir.c_str(), &status) == 0 && (status.st_mode & S_ISVTX) != 0) {
+    if (stat(DirectoryOf(szPath).c_str(), &status) == 0 && (status.st_mode & S_ISVTX) != 0) {
         return szPath;
     }
     const std::unique_ptr<char, decltype(&std::free)> szReal(realpath(szPath.c_str(), nullptr), &std::free);
@@ -234,9 +233,7 @@ std::string Resolve(const std::string& szPath) {
 }
 
 // The new name must survive a power cut as well.
-void FlushDirectory(const std::string& szPath) {
-    const size_t nSlash = szPath.rfind('/');
-    const std::string szDir = nSlash == std::string::npos ? "." : szPath.substr(0, nSlash + 1);
+void FlushDirectory(const std::string& szDir) {
     const Descriptor fd(open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (fd.Get() >= 0) {
         fsync(fd.Get());
@@ -260,6 +257,11 @@ bool KeepOwnerAndMode(int fd, const std::string& szTarget, mode_t nNewMode) {
 }
 
 }  // namespace
+
+std::string DirectoryOf(const std::string& szPath) {
+    const size_t nSlash = szPath.rfind('/');
+    return nSlash == std::string::npos ? "." : szPath.substr(0, nSlash + 1);
+}
 
 std::optional<std::string> ReadFile(const std::string& szPath) {
     const Descriptor fd(open(szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
@@ -292,6 +294,7 @@ std::optional<std::string> ReadFile(const std::string& szPath) {
 
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode) {
     const std::string szTarget = Resolve(szPath);
+    const std::string szDir = DirectoryOf(szTarget);  // beforehand: nothing may fail any more after the renaming
     NewFile file(szTarget);
     if (file.Fd() < 0) {
         return Fail(TLIBC_ERR_OPEN, __LINE__);
@@ -302,7 +305,7 @@ bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t 
     if (!file.Rename(szTarget)) {
         return Fail(TLIBC_ERR_RENAME, __LINE__);
     }
-    FlushDirectory(szTarget);
+    FlushDirectory(szDir);
     return true;
 }
 

@@ -27,6 +27,9 @@ struct Section {
     std::vector<Pair> rgPairs;
 };
 
+// The directory that a path leads into, with a "/" at its end; "." where it names none.
+std::string DirectoryOf(const std::string& szPath);
+
 // The whole file. Nothing, with the last error set, when it is missing (TLIBC_ERR_NOT_FOUND), unreadable,
 // no regular file or larger than 16 MiB.
 TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath);

@@ -9,6 +9,7 @@
 
 #include <map>
 #include <new>
+#include <sstream>
 
 #include "core/Border.h"
 #include "core/TextFile.h"
@@ -84,7 +85,11 @@ std::string FormatRecord(const Properties& properties) {
     Json::StreamWriterBuilder builder;
     builder["indentation"] = "  ";
     builder["emitUTF8"] = true;  // a router's text comes back byte for byte, also when it is no UTF-8
-    return Json::writeString(builder, root) + "\n";
+    std::ostringstream text;
+    text.exceptions(std::ios::badbit);  // a stream keeps silent about memory that ran out, and half a record is none
+    std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter())->write(root, &text);
+    text << '\n';
+    return text.str();
 }
 
 std::optional<Properties> ReadRecord(const std::string& szPath) {

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
+#include <optional>
 #include <set>
 
 #include "core/Border.h"
@@ -29,8 +30,8 @@ constexpr auto kTableLimit = std::chrono::seconds(30);
 struct Client {
     pid_t nOwner = getpid();
     std::unique_ptr<tavo::Igd> pIgd;
-    Clock::time_point tableStart;
-    std::set<std::pair<std::string, uint16_t>> setRead;  // since index 0 was asked for
+    std::optional<Clock::time_point> walkStart;
+    std::set<std::pair<std::string, uint16_t>> setRead;  // since the walk began
     tavo::RouterMapping last;
     bool blLast = false;
 };
@@ -49,12 +50,12 @@ Client* Own() {
 
 // The entry at an index, told once: a router that ignores the index has no second entry.
 int ReadEntry(Client& client, int nIndex, tavo::RouterMapping& mapping) {
-    if (nIndex == 0) {
-        client.tableStart = Clock::now();
+    if (nIndex == 0 || !client.walkStart) {
+        client.walkStart = Clock::now();
         client.setRead.clear();
     }
     client.blLast = false;
-    if (Clock::now() - client.tableStart > kTableLimit) {
+    if (Clock::now() - *client.walkStart > kTableLimit) {
         return tavo::kRouterTimeout;
     }
     const int nCode = client.pIgd->GetAt(nIndex, mapping);
