@@ -4,23 +4,21 @@
 #include "common.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <chrono>
 #include <climits>
 #include <cstdarg>
 #include <cstdlib>
 #include <cstring>
 #include <utility>
 
+#include "Tool.h"
 #include "tavo/net.h"
 #include "tavo/task.h"
 
@@ -40,8 +38,6 @@ constexpr size_t kPathSize = 4096;
 constexpr size_t kToolLineSize = 1024;
 constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
 constexpr std::string_view kVersionKey = "syntax version";
-constexpr int kToolSeconds = 10;            // a tool that has not answered by then hangs
-constexpr int kToolLookMilliseconds = 100;  // between two looks whether it has ended
 
 // The two refusals that every accessor of a rule section begins with.
 bool HasHash(const TAVO_PF_CONF* pConf) {
@@ -54,87 +50,6 @@ bool HasHash(const TAVO_PF_CONF* pConf) {
         return false;
     }
     return true;
-}
-
-// A shell command whose output is read through a pipe. It shares no other descriptor with us, so that one
-// that stays alive holds no lock of ours; one that has not ended within kToolSeconds is killed.
-class Tool {
-public:
-    ~Tool();
-    bool Start(const char* szCommand);
-    // What it printed next; 0: it has ended, or its time has.
-    ssize_t Read(char* szBlock, size_t nSize);
-
-private:
-    using Clock = std::chrono::steady_clock;
-
-    int MillisecondsLeft() const;
-    // Whether the command itself is over; what it left behind may still hold the pipe.
-    bool HasEnded();
-
-    int mFd = -1;
-    pid_t mPid = -1;
-    Clock::time_point mEnd;
-};
-
-bool Tool::Start(const char* szCommand) {
-    int rgFd[2];
-    if (pipe2(rgFd, O_CLOEXEC) != 0) {
-        return false;
-    }
-    mFd = rgFd[0];
-    mEnd = Clock::now() + std::chrono::seconds(kToolSeconds);
-    mPid = fork();
-    if (mPid == 0) {
-        setpgid(0, 0);
-        dup2(rgFd[1], STDOUT_FILENO);
-        fcntl(STDOUT_FILENO, F_SETFD, 0);  // where the pipe itself had that number
-        closefrom(STDERR_FILENO + 1);
-        execl("/bin/sh", "sh", "-c", szCommand, nullptr);
-        _exit(127);
-    }
-    close(rgFd[1]);
-    return mPid > 0;
-}
-
-int Tool::MillisecondsLeft() const {
-    const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mEnd - Clock::now()).count();
-    return static_cast<int>(std::clamp<int64_t>(nLeft, 0, kToolLookMilliseconds));
-}
-
-bool Tool::HasEnded() {
-    if (mPid > 0 && waitpid(mPid, nullptr, WNOHANG) != 0) {
-        mPid = -1;
-    }
-    return mPid < 0;
-}
-
-ssize_t Tool::Read(char* szBlock, size_t nSize) {
-    for (bool blLast = false;;) {
-        const int nLeft = MillisecondsLeft();
-        pollfd waiting = {mFd, POLLIN, 0};
-        if (nLeft > 0 && poll(&waiting, 1, blLast ? 0 : nLeft) > 0) {
-            return std::max<ssize_t>(read(mFd, szBlock, nSize), 0);
-        }
-        if (nLeft == 0 || blLast) {
-            return 0;
-        }
-        blLast = HasEnded();  // one more look: it may have printed just before
-    }
-}
-
-Tool::~Tool() {
-    if (mFd >= 0) {
-        close(mFd);
-    }
-    int nLeft = 0;
-    while (!HasEnded() && (nLeft = MillisecondsLeft()) > 0) {
-        usleep(1000);
-    }
-    if (mPid > 0) {
-        kill(-mPid, SIGKILL);
-        waitpid(mPid, nullptr, 0);
-    }
 }
 
 // Finds the version in what the tool prints; the last line that gives one wins.
@@ -549,7 +464,7 @@ bool IsGenericRouterName(bool& isGeneric, char* szName) {
 }
 
 int IGetCurrSyntaxVersion() {
-    Tool tool;
+    tavo::lib::Tool tool;
     if (!tool.Start(kVersionCommand)) {
         LogError("%s:%d popen tavoportforward error", kFile, __LINE__);
         return -1;

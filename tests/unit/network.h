@@ -1,5 +1,5 @@
 // A network that a test scripts: what the checks, the router and the services answer. The stand-ins are in
-// test_detection.cpp; while gPNetwork is null, the real platform answers.
+// test_network.cpp; while gPNetwork is null, the real platform answers.
 #pragma once
 
 #include <dlfcn.h>
@@ -18,7 +18,8 @@ struct Network {
     std::optional<int> nLevel = 1;
     int nDns = 0;
     int nUpnpInit = 0;
-    int nUpnpPort = 0;  // the one last asked for
+    std::function<void()> fnInit;  // when a detection begins to look for UPnP
+    int nUpnpPort = 0;             // the one last asked for
     std::optional<TAVO_UPNP_GATEWAY_MODEL> model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"};
     int nServiceRestart = 0;
     int nRouterDbUpdates = 0;

@@ -18,84 +18,6 @@
 #include "tavo/portforward.h"
 #include "world.h"
 
-Network* gPNetwork = nullptr;
-
-namespace {
-
-// Called when a detection begins to look for UPnP.
-std::function<void()> gFnOnDetectorInit;
-
-}  // namespace
-
-extern "C" {
-int checkGwIfEnable(char* szInterface, int nSize) {
-    if (gPNetwork == nullptr) {
-        return Real("checkGwIfEnable", &checkGwIfEnable)(szInterface, nSize);
-    }
-    snprintf(szInterface, static_cast<size_t>(nSize), "eth0");
-    return gPNetwork->nInterface;
-}
-int checkDefaultGatewaySetting(char* szGateway, int nSize) {
-    if (gPNetwork == nullptr) {
-        return Real("checkDefaultGatewaySetting", &checkDefaultGatewaySetting)(szGateway, nSize);
-    }
-    snprintf(szGateway, static_cast<size_t>(nSize), "192.168.1.1");
-    return gPNetwork->nGateway;
-}
-int checkConnectToWAN() {
-    return gPNetwork == nullptr ? Real("checkConnectToWAN", &checkConnectToWAN)() : gPNetwork->nWan;
-}
-int checkDNSSetting() {
-    return gPNetwork == nullptr ? Real("checkDNSSetting", &checkDNSSetting)() : gPNetwork->nDns;
-}
-int TAVOUpnpInit(int nLimit, int nPort) {
-    if (gPNetwork == nullptr) {
-        return Real("TAVOUpnpInit", &TAVOUpnpInit)(nLimit, nPort);
-    }
-    if (gFnOnDetectorInit) {
-        gFnOnDetectorInit();
-    }
-    gPNetwork->nUpnpPort = nPort;
-    return nLimit == 30 ? gPNetwork->nUpnpInit : 1;
-}
-int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL* pModel) {
-    if (gPNetwork == nullptr) {
-        return Real("TAVOUpnpGatewayModelGet", &TAVOUpnpGatewayModelGet)(pModel);
-    }
-    *pModel = gPNetwork->model.value_or(TAVO_UPNP_GATEWAY_MODEL{});
-    return gPNetwork->model ? 0 : -1;
-}
-int TLIBServiceRestart(const char* szName) {
-    if (gPNetwork == nullptr) {
-        return Real("TLIBServiceRestart", &TLIBServiceRestart)(szName);
-    }
-    const OwnMemory own;
-    if (gPNetwork->szAnnounced) {
-        Write("/tmp/airport.tcp.local", *gPNetwork->szAnnounced);
-    }
-    if (gPNetwork->fnAnnounce) {
-        gPNetwork->fnAnnounce();
-    }
-    return strcmp(szName, "avahi") == 0 ? gPNetwork->nServiceRestart : -2;
-}
-int TAVOPFRouterDBUpdate() {
-    if (gPNetwork == nullptr) {
-        return Real("TAVOPFRouterDBUpdate", &TAVOPFRouterDBUpdate)();
-    }
-    ++gPNetwork->nRouterDbUpdates;
-    gPNetwork->fnRouterDbUpdate();
-    return 1;
-}
-}
-
-int getPublicIPLevel(int& nLevel, int nHops) {
-    if (gPNetwork == nullptr) {
-        return Real("_Z16getPublicIPLevelRii", &getPublicIPLevel)(nLevel, nHops);
-    }
-    nLevel = gPNetwork->nLevel.value_or(nLevel);
-    return nHops == 3 && gPNetwork->nLevel ? 0 : -1;
-}
-
 namespace {
 
 using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
@@ -138,7 +60,6 @@ protected:
         gPNetwork = nullptr;
         gFnOnSleep = nullptr;
         gFnOnConfSet = nullptr;
-        gFnOnDetectorInit = nullptr;
         gStage = {};
     }
     static void SetTool(const std::string& szLine) {
@@ -355,7 +276,7 @@ TEST_F(Detection, FilesThatOthersPlantedInTmpHoldNobody) {
 }
 
 TEST_F(Detection, AResultThatCannotBeStoredIsNoSuccess) {
-    gFnOnDetectorInit = [] {
+    mNetwork.fnInit = [] {
         std::filesystem::remove_all("/var/lib/tavo/tasks");
         Write("/var/lib/tavo/tasks", "");
     };
@@ -490,7 +411,7 @@ TEST_F(Detection, ChildWithoutGatewayReturnsAndLeavesTheLockToItsParent) {
     };
     std::filesystem::remove("/tmp/child_progress");
     bool blLockedAfterChild = false;
-    gFnOnDetectorInit = [&] {
+    mNetwork.fnInit = [&] {
         for (int i = 0; i < 500 && !std::filesystem::exists("/tmp/child_done"); ++i) {
             usleep(10000);
         }
@@ -503,7 +424,7 @@ TEST_F(Detection, ChildWithoutGatewayReturnsAndLeavesTheLockToItsParent) {
         Write("/tmp/child_done", std::to_string(nResult));
         _exit(0);
     }
-    gFnOnDetectorInit = nullptr;
+    mNetwork.fnInit = nullptr;
     EXPECT_EQ(Read("/tmp/child_done"), "-1");
     EXPECT_EQ(Read("/tmp/child_progress"), "80");
     EXPECT_TRUE(blLockedAfterChild);
