@@ -1,13 +1,16 @@
-// Tests a router by the platform's calls, in the library's order but without its pauses, and prints one line
-// of JSON: the step that failed, the count, and how long it took. Usage: compat N
+// Tests a router and prints one line of JSON about it.
+// Usage: compat steps N   by the platform's calls, in the library's order but without its pauses
+//        compat test N    by the library
+//        compat stop      ends a test of another process, by the library
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <functional>
+#include <string>
 
+#include "libtavoportmap.h"
 #include "tavo/core.h"
 #include "tavo/upnptest.h"
 
@@ -59,13 +62,28 @@ const char* FailedStep(int nRules, int& nCount) {
     return Step("upnp_terminal", &TAVOUPnPDeletetest) ? "" : "upnp_terminal";
 }
 
+int RunSteps(int nRules) {
+    int nCount = 0;
+    const char* szFailed = FailedStep(nRules, nCount);
+    std::printf("{\"failed\": \"%s\", \"count\": %d}\n", szFailed, nCount);
+    return *szFailed == '\0' ? 0 : 1;
+}
+
+int RunTest(int nRules) {
+    __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT result = {};
+    const int nResult = TLibTestUpnpCompatibility(nRules, &result, nullptr, nullptr, true);
+    std::printf("{\"result\": %d, \"status\": %d, \"support\": \"%s\", \"max\": %d}\n", nResult, result.nStatus,
+                result.szSupport, result.nMaxRule);
+    return nResult == 0 ? 0 : 1;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
-    const auto start = std::chrono::steady_clock::now();
-    int nCount = 0;
-    const char* szFailed = FailedStep(argc > 1 ? std::atoi(argv[1]) : 0, nCount);
-    const std::chrono::duration<double> took = std::chrono::steady_clock::now() - start;
-    std::printf("{\"failed\": \"%s\", \"count\": %d, \"seconds\": %.2f}\n", szFailed, nCount, took.count());
-    return *szFailed == '\0' ? 0 : 1;
+    const std::string szVerb = argc > 1 ? argv[1] : "";
+    const int nRules = argc > 2 ? std::atoi(argv[2]) : 0;
+    if (szVerb == "stop") {
+        return TLibStopTestUpnpCompatibility();
+    }
+    return szVerb == "test" ? RunTest(nRules) : RunSteps(nRules);
 }

@@ -13,12 +13,12 @@ FILES = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/ro
 RULES = "/var/lib/tavo/upnp_test.conf"
 
 
-def start(rules):
-    return LAB.start("box", f"{BUILD}/tests/lab/compat", str(rules), stdout=subprocess.PIPE, text=True)
+def start(*arguments):
+    return LAB.start("box", f"{BUILD}/tests/lab/compat", *map(str, arguments), stdout=subprocess.PIPE, text=True)
 
 
-def run(rules, seconds=60):
-    out, _ = start(rules).communicate(timeout=seconds)
+def run(rules, how="steps", seconds=60):
+    out, _ = start(how, rules).communicate(timeout=seconds)
     return json.loads(out)
 
 
@@ -91,25 +91,33 @@ class Compat(unittest.TestCase):
         self.assertEqual((answer["failed"], answer["count"]), ("", 32))
         self.assertEqual(sorted(row[1] for row in LAB.scripted()["table"]), [6001, 24501])
 
-    def stop(self):
-        """As the library ends a test from another process."""
-        LAB.run("box", "/usr/tavo/bin/tavoupnptest -t >/dev/null 2>&1 &")
-        for pid in test_daemon():
-            os.kill(pid, signal.SIGHUP)
-        for path in FILES:
-            if os.path.exists(path):
-                os.unlink(path)
+    def test_the_library_in_its_own_time(self):
+        LAB.start_router()
+        self.assertEqual(run(10, "test"), {"result": 0, "status": 0, "support": "yes", "max": 10})
+        self.assertEqual(LAB.mappings(), {})
+        LAB.stop_router()
+        LAB.start_scripted("keeps_nothing")
+        self.assertEqual(run(10, "test"), {"result": 1, "status": 0, "support": "no", "max": -1})
+
+    def test_a_second_start_ends_the_first(self):
+        LAB.start_scripted("silent_adds_at_10")
+        first = start("test", 60)
+        wait_for(lambda: len(LAB.scripted()["table"]) == 10, 10, "some mappings are there")
+        self.assertEqual(run(10, "test")["result"], -1)  # the lock is the first one's
+        self.ended(15)
+        self.assertEqual(json.loads(first.communicate(timeout=20)[0])["result"], 1)
+        self.assertEqual(LAB.scripted()["table"], [])
 
     def test_stop_ends_a_test_that_hangs(self):
         for fault, left in (("silent_adds_at_10", 0), ("silent_at_10", 10)):
             with self.subTest(fault=fault):
                 LAB.start_scripted(fault)
-                caller = start(60)
+                caller = start("steps", 60)
                 wait_for(lambda: len(LAB.scripted()["table"]) == 10, 10, "the router has become silent")
-                self.stop()
+                self.assertEqual(start("stop").wait(5), 0)
                 self.ended(3)
                 self.assertEqual(len(LAB.scripted()["table"]), left)
-                self.assertNotEqual(caller.wait(5), 0)
+                self.assertEqual(caller.wait(5), 1)
                 self.assertEqual([path for path in FILES if os.path.exists(path)], [])
                 LAB.end(LAB.router)
 
@@ -119,7 +127,7 @@ class Compat(unittest.TestCase):
         for how, which, left in ((signal.SIGTERM, (0,), 0), (signal.SIGTERM, (1,), 0), (signal.SIGKILL, (0,), 0),
                                  (signal.SIGKILL, (1,), 0), (signal.SIGKILL, (0, 1), 10)):
             with self.subTest(how=how, which=which):
-                caller = start(60)
+                caller = start("steps", 60)
                 wait_for(lambda: len(LAB.scripted()["table"]) == 10, 10, "some mappings are there")
                 pids = sorted(test_daemon())
                 for index in which:

@@ -98,6 +98,7 @@ bool TestDaemon::FindRouter() {
     mPIgd = FindGatewayIgd(kDiscoveryMilliseconds, 0, &szBox, [this] { return IsSignalled(); });
     if (mPIgd == nullptr) {
         Log("no router with UPnP port mapping was found");
+        WriteFileAtomic(kResultFile, "upnp=noigd\n", kResultMode);
         return false;
     }
     for (const RouterMapping& wanted : ReadWanted(kRunKey).rgMappings) {
