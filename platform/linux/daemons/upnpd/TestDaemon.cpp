@@ -97,8 +97,10 @@ bool TestDaemon::FindRouter() {
     std::string szBox;
     mPIgd = FindGatewayIgd(kDiscoveryMilliseconds, 0, &szBox, [this] { return IsSignalled(); });
     if (mPIgd == nullptr) {
-        Log("no router with UPnP port mapping was found");
-        WriteFileAtomic(kResultFile, "upnp=noigd\n", kResultMode);
+        if (!IsSignalled()) {
+            Log("no router with UPnP port mapping was found");
+            WriteFileAtomic(kResultFile, "upnp=noigd\n", kResultMode);
+        }
         return false;
     }
     for (const RouterMapping& wanted : ReadWanted(kRunKey).rgMappings) {
