@@ -6,6 +6,7 @@ import subprocess
 import unittest
 
 import homelab
+import test_reach
 from homelab import BOX, BUILD, LAN2, wait_for
 
 LAB = None
@@ -29,9 +30,7 @@ def test_daemon():
 class Compat(unittest.TestCase):
     def setUp(self):
         LAB.install()
-        for path in FILES:
-            if os.path.exists(path):
-                os.unlink(path)
+        LAB.clear_state(*FILES)
 
     def tearDown(self):
         LAB.stop_daemon(signal.SIGKILL)
@@ -108,6 +107,25 @@ class Compat(unittest.TestCase):
         self.assertEqual(json.loads(first.communicate(timeout=20)[0])["result"], 1)
         self.assertEqual(LAB.scripted()["table"], [])
 
+    def test_a_checker_outside_is_believed(self):
+        LAB.start_router()
+        test_reach.configure()
+        checker = test_reach.start_checker()
+        try:
+            self.assertEqual(run(10)["failed"], "")
+            self.assertIn("from outside 4 of 4 test ports are open", LAB.read("/var/log/router.log"))
+            test_reach.drop("router", "tcp", "24500-24600", "forward")  # a router that says yes and passes nothing on
+            self.assertEqual(run(10)["failed"], "upnp_connection_success")
+            LAB.end(checker)
+            self.ended()
+            self.assertEqual(run(10)["failed"], "")
+            self.assertIn("the router's own table is the judge", LAB.read("/var/log/router.log"))
+            self.ended()
+            self.assertEqual(LAB.mappings(), {})
+        finally:
+            LAB.end(checker)
+            LAB.run("router", "nft delete table inet blocked", check=False)
+
     def test_stop_ends_a_test_that_hangs(self):
         for fault, left in (("silent_adds_at_10", 0), ("silent_at_10", 10)):
             with self.subTest(fault=fault):
@@ -143,7 +161,7 @@ class Compat(unittest.TestCase):
 
 def prepare(lab):
     global LAB
-    LAB = lab
+    LAB = test_reach.LAB = lab
     lab.serve(5001, 5002)
 
 
