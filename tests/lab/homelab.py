@@ -220,10 +220,10 @@ class Lab:
 
     # ---- the real router ----------------------------------------------------------------------------
 
-    def start_router(self, version1=False, port=5000):
+    def start_router(self, version1=False, port=5000, upnp=True):
         self.write("/tmp/miniupnpd.conf", "\n".join((
             "ext_ifname=wan0", f"ext_ip={PUBLIC}", "listening_ip=br0", f"http_port={port}", "enable_natpmp=yes",
-            "enable_upnp=yes", "secure_mode=yes", "upnp_table_name=home", "upnp_nat_table_name=home",
+            f"enable_upnp={'yes' if upnp else 'no'}", "secure_mode=yes", "upnp_table_name=home", "upnp_nat_table_name=home",
             "upnp_forward_chain=miniupnpd", "upnp_nat_chain=prerouting_miniupnpd",
             "upnp_nat_postrouting_chain=postrouting_miniupnpd", "uuid=00000000-0000-0000-0000-000000000001",
             "force_igd_desc_v1=" + ("yes" if version1 else "no"), "allow 1-65535 192.168.77.0/24 1-65535",
@@ -233,8 +233,9 @@ class Lab:
         self.run("router", "/usr/sbin/miniupnpd -f /tmp/miniupnpd.conf -P /tmp/miniupnpd.pid >/dev/null 2>&1")
         self.router = Detached("/tmp/miniupnpd.pid")
         self.processes.append(self.router)
-        wait_for(lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
-                                  check=False).returncode == 0, 10, "the router is up")
+        wait_for((lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
+                                   check=False).returncode == 0) if upnp else
+                 lambda: self.run("router", "ss -Hlun sport = :5351").stdout, 10, "the router is up")
 
     def stop_router(self):
         """Without a word to anybody, as when the power goes."""
