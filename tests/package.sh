@@ -11,12 +11,17 @@ readonly szPackage=$(echo "$PWD"/*.deb)
 
 dpkg --force-depends -i "$szPackage" >/dev/null
 for szUnit in $(dpkg -L libtavoportmap | sed -n 's|^/usr/lib/systemd/system/||p'); do
-    [ -L "/etc/systemd/system/multi-user.target.wants/$szUnit" ] || fail "$szUnit is not enabled"
+    blEnabled=$([ -L "/etc/systemd/system/multi-user.target.wants/$szUnit" ] && echo yes || echo no)
+    [ "$blEnabled" = "$([ "$szUnit" = tavoportcheckd.service ] && echo no || echo yes)" ] ||
+        fail "$szUnit enabled: $blEnabled"
     szProgram=$(sed -n 's/^ExecStart=\([^ ]*\).*/\1/p' "/usr/lib/systemd/system/$szUnit")
     [ -x "$szProgram" ] || fail "$szUnit starts $szProgram, which is not there"
     ldd "$szProgram" | grep -q 'not found' && fail "$szProgram lacks a library"
 done
-dpkg-query -W -f '${Conffiles}' libtavoportmap | grep -q '^ */etc/tavo/platform.conf ' || fail "no conffile"
+for szConf in platform.conf portcheck.conf; do
+    dpkg-query -W -f '${Conffiles}' libtavoportmap | grep -q "^ */etc/tavo/$szConf " || fail "$szConf is no conffile"
+done
+[ "$(stat -c %a /etc/tavo/portcheck.conf)" = 600 ] || fail "others can read the port checker's token"
 tavoportmap status | grep -q '^gateway' || fail "the installed tool does not run"
 tavoportmap rules add web --router-port 443 >/dev/null
 

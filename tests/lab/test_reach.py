@@ -66,14 +66,10 @@ def rules(*lines):
     LAB.write("/etc/portforward/rule.conf", text)
 
 
-def test(*prefix):
-    out = LAB.run("box", " ".join((*prefix, f"{BUILD}/tests/lab/porttester"))).stdout
+def test(*prefix, arguments=()):
+    """Verdicts and texts."""
+    out = LAB.run("box", " ".join(map(str, (*prefix, f"{BUILD}/tests/lab/porttester", *arguments)))).stdout
     return [tuple(entry) for entry in json.loads(out)]
-
-
-def own(*arguments):
-    out = LAB.run("box", f"{BUILD}/tests/lab/porttester own " + " ".join(map(str, arguments))).stdout
-    return tuple(json.loads(out)[0])
 
 
 def drop(host, protocol, port, hook, how="drop"):
@@ -130,7 +126,7 @@ class Rules(unittest.TestCase):
         drop("box", "tcp", 5006, "prerouting")
         drop("router", "tcp", 5011, "input", "reject with icmpx admin-prohibited")
         start = time.monotonic()
-        self.check((
+        cases = (
             ("1 tcp 5001 5001", OPEN, "5001/tcp: open"),
             ("1 tcp 5002 5002", NOLISTEN, "5002/tcp: nobody listens on port 5002 of this box"),
             ("1 tcp 5003 5003", TIMEOUT, "nothing came to this box"),
@@ -147,8 +143,12 @@ class Rules(unittest.TestCase):
             ("1 udp 6003 6003", UNKNOWN, "a program has port 6003"),
             ("1 udp 6004 6004", REFUSED, "refused before it came to this box"),
             ("1 tcp 5001-5003 5001-5003", TIMEOUT, "5002/tcp: nobody listens on port 5002 of this box; 5001/tcp: open"),
-            ("1 tcp 5001-5003 5001", UNKNOWN, "paired")))
+            ("1 tcp 5001-5003 5001", UNKNOWN, "paired"))
+        self.check(cases)
         self.assertLess(time.monotonic() - start, 12)
+        by_library = {OPEN: 2, REFUSED: 3, TIMEOUT: 3, DISABLED: 1, UNKNOWN: 0, NOLISTEN: 0}
+        self.assertEqual([status for status, _ in test(arguments=("library",))],
+                         [by_library[status] for _, status, _ in cases])
 
     def test_without_privileges_what_cannot_be_told_is_unknown(self):
         self.serve("box", 5001)
@@ -171,7 +171,7 @@ class Rules(unittest.TestCase):
         self.processes.append(LAB.start("lan2", "/usr/bin/python3", f"{HERE}/echo.py", "serve", "5004"))
         wait_for_port("lan2", LAN2, 5004)
         for port, status in ((5002, OPEN), (5003, TIMEOUT), (5004, REFUSED), (5005, REFUSED)):
-            self.assertEqual(own("TCP", port, port)[0], status, port)
+            self.assertEqual(test(arguments=("own", "TCP", port, port))[0][0], status, port)
 
     def test_a_checker_behind_a_web_server_with_tls(self):
         self.serve("box", 5001)
