@@ -105,7 +105,9 @@ TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
 TEST(Igd, AnswersThatAreNoneAreGarbage) {
     EXPECT_EQ(tavo::SoapCode(200, "<e><Body><r/></Body></e>"), tavo::kRouterOk);
     EXPECT_EQ(tavo::SoapCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);
-    for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>"}) {
+    for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>",
+                              "<e><Body><Fault><errorCode>1</errorCode></Fault></Body></e>",
+                              "<e><Body><Fault><errorCode>0</errorCode></Fault></Body></e>"}) {
         EXPECT_EQ(tavo::SoapCode(200, szXml), tavo::kRouterGarbage) << szXml;
     }
     EXPECT_EQ(tavo::SoapCode(404, "<e><Body><r/></Body></e>"), tavo::kRouterGarbage);

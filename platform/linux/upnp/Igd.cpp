@@ -23,6 +23,7 @@ using tinyxml2::XMLElement;
 
 constexpr size_t kMaxText = 256;
 constexpr int kMaxDepth = 12;
+constexpr int kLeastErrorCode = 100;  // no protocol has less, and as a status "1" is success
 constexpr int kMaxEntries = 65536;
 constexpr auto kListLimit = std::chrono::seconds(30);
 constexpr char kEncoding[] = "http://schemas.xmlsoap.org/soap/encoding/";
@@ -260,7 +261,7 @@ int SoapCode(long nHttpCode, const std::string& szXml) {
         return nHttpCode == 200 && FindElement(document.RootElement(), "Body") != nullptr ? kRouterOk : kRouterGarbage;
     }
     const auto nCode = ParseNumber<int>(TextOf(FindElement(document.RootElement(), "errorCode")));
-    return nCode && *nCode > 0 ? *nCode : kRouterGarbage;
+    return nCode && *nCode >= kLeastErrorCode ? *nCode : kRouterGarbage;
 }
 
 std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp) {
