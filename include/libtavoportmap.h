@@ -298,15 +298,35 @@ TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUT
                            __tag_TAVO_ROUTER_SAVE_RULE_RESULT* saveResult,
                            void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData);
 
+/* ---- relay service ------------------------------------------------------------------------------ */
+
+/* Replaces the rules of the service szServiceName by nRules requests (0 and NULL: takes them all out), keeps
+ * what the user's rules and other hosts' mappings hold, and saves the outcome to the router; waits as
+ * TLibSaveRules does. Takes the router lock itself. blTestConnection: then tests every port asked for, also
+ * those that somebody else keeps, and writes each request's nTestConnStatus. 0; 1: the router has not been
+ * detected; 2: the lock is held; -1: failed. rule.conf is as before unless the save came as far as writing
+ * it; a test that fails leaves the new rules in place. */
+TAVO_API int TLibTavoPortMapRulesSet(const char* szServiceName, __tag_TAVO_PORTMAP_RULE* rgRules, int nRules,
+                                     bool blTestConnection);
+/* Has the router in front classified, once: later calls answer what is stored. Takes the router lock itself;
+ * a detection takes several seconds, the compatibility test of an unknown router minutes. 0: it maps ports
+ * by itself; 1: it is a manual router; 2: the lock is held; -1: failed. As from TLibDetectRouter, a child
+ * that cannot tell the gateway's address returns too, with -1 and without the lock. */
+TAVO_API int TLibTavoPortMapRouterDetect(void);
+
 /* ---- relay service: diagnostics, what they find goes to standard output ----------------------------- */
 
 /* At most ten numbers ("1,2,3,7") as a port list ("1-3, 7"), cut at nOut - 1. 0 or -1. */
 TAVO_API int TestFuncToPorts(char* szOut, int nOut, const char* szNumbers);
 /* Prints the rules of rule.conf with their ports taken apart. 0 or -1. */
 TAVO_API int TestFuncCreateOpRulesByRuleConf(void);
-/* Shows what a service's request ("hoplink;5000-5001;tcp;6000;udp", nine pairs at most) loses to other
- * hosts' mappings on a UPnP router. Changes nothing. 0 or -1. */
+/* These take a service's request as text: "hoplink;5000-5001;tcp;6000;udp", nine pairs at most. 0 or -1. */
+/* Tests the ports from outside; saves nothing. */
+TAVO_API int TestFuncTestRules(const char* szRequest);
+/* Shows what the request loses to other hosts' mappings on a UPnP router; changes nothing. */
 TAVO_API int TestFuncDeleteConflictPortsForUPnPRouter(const char* szRequest);
+/* TLibTavoPortMapRulesSet with a test, and its statuses; 0 also where that answered 1 or 2. */
+TAVO_API int TestFuncSetRules(const char* szRequest);
 
 /* ---- router tests -------------------------------------------------------------------------------- */
 
@@ -333,7 +353,7 @@ TAVO_API int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TA
 #ifdef __cplusplus
 } /* extern "C" */
 
-/* ---- relay service ------------------------------------------------------------------------------ */
+/* ---- relay service: ports ----------------------------------------------------------------------- */
 
 /* Appends the ports of a text ("80,443,8000-8010"; a range written backwards counts forwards) in their
  * order, duplicates kept. 0, or -1: null, no port at all, or one outside 1 to 65535; what stood before it

@@ -3,6 +3,7 @@
 // standard output, errors to the system log; everything built is freed on every path.
 #include <cstring>
 
+#include "HopLink.h"
 #include "RuleConflicts.h"
 
 namespace {
@@ -15,6 +16,7 @@ using tavo::lib::PortList;
 
 constexpr int kMaxNumbers = 10;
 constexpr int kRequestRoom = 10;  // the one that fills it is refused
+constexpr const char* kTestStatuses[] = {"not test", "disabled", "ok", "fail"};
 
 void PrintPorts(const char* szTitle, const PortList& ports) {
     std::printf("%s", szTitle);
@@ -131,18 +133,63 @@ void DumpOperationRules(const char* szTitle, const OPERATION_RULE* rgOpRules, in
     }
 }
 
-int DeleteConflicts(const char* szRequest) {
+bool CreateOperationRules(tavo::lib::OperationRules& rules, const ServiceRequests& requests) {
+    if (CreateOperationRulesArray(&rules.rgRules, &rules.nRules, requests.szServiceName.c_str(), requests.rgRules,
+                                  requests.nRules) != 0) {
+        std::puts("CreateOperationRulesArray(rgRules) failed");
+        return false;
+    }
+    return true;
+}
+
+void PrintStatuses(const ServiceRequests& requests) {
+    for (int i = 0; i < requests.nRules; ++i) {
+        const __tag_TAVO_PORTMAP_RULE& rule = requests.rgRules[i];
+        const auto nStatus = static_cast<unsigned>(rule.nTestConnStatus);
+        std::printf("router_ports [%s]=%s\n", rule.szPorts,
+                    nStatus < std::size(kTestStatuses) ? kTestStatuses[nStatus] : "unknown");
+    }
+}
+
+int TestRequests(const char* szRequest) {
+    ServiceRequests requests;
+    tavo::lib::OperationRules opRules;
+    if (!ReadRequests(requests, szRequest) || !CreateOperationRules(opRules, requests)) {
+        return -1;
+    }
+    tavo::lib::RouterRules rules;
+    if (CreateRulesArray(&rules.rgRules, &rules.nRules, nullptr, 0, opRules.rgRules, opRules.nRules) != 0) {
+        LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
+        return -1;
+    }
+    if (tavo::lib::TestRequestedRules(rules, requests.rgRules) != 0) {
+        return -1;
+    }
+    PrintStatuses(requests);
+    return 0;
+}
+
+// A lock that is held and a router that is not known are answers too: they print what stands in the requests.
+int SetRequests(const char* szRequest) {
     ServiceRequests requests;
     if (!ReadRequests(requests, szRequest)) {
         return -1;
     }
-    const char* szServiceName = requests.szServiceName.c_str();
-    tavo::lib::OperationRules rules;
-    if (CreateOperationRulesArray(&rules.rgRules, &rules.nRules, szServiceName, requests.rgRules, requests.nRules) !=
-        0) {
-        std::puts("CreateOperationRulesArray(rgRules) failed");
+    if (TLibTavoPortMapRulesSet(requests.szServiceName.c_str(), requests.rgRules, requests.nRules, true) < 0) {
+        std::puts("TLibTavoPortMapRulesSet() failed");
         return -1;
     }
+    PrintStatuses(requests);
+    return 0;
+}
+
+int DeleteConflicts(const char* szRequest) {
+    ServiceRequests requests;
+    tavo::lib::OperationRules rules;
+    if (!ReadRequests(requests, szRequest) || !CreateOperationRules(rules, requests)) {
+        return -1;
+    }
+    const char* szServiceName = requests.szServiceName.c_str();
     DumpOperationRules("before delete", rules.rgRules, rules.nRules);
     if (DeleteConflictPortsForUPnPRouter(rules.rgRules, rules.nRules, nullptr, 0, szServiceName) != 0) {
         std::puts("DeleteConflictPortsForUPnPRouter() failed");
@@ -194,6 +241,14 @@ int TestFuncGetUsedRouterPortList(std::list<int>& tcpPorts, std::list<int>& udpP
     return AtBorder(-1, [&] { return tavo::lib::GetUsedRouterPortList(tcpPorts, udpPorts); });
 }
 
+int TestFuncTestRules(const char* szRequest) {
+    return AtBorder(-1, [&] { return TestRequests(szRequest); });
+}
+
 int TestFuncDeleteConflictPortsForUPnPRouter(const char* szRequest) {
     return AtBorder(-1, [&] { return DeleteConflicts(szRequest); });
+}
+
+int TestFuncSetRules(const char* szRequest) {
+    return AtBorder(-1, [&] { return SetRequests(szRequest); });
 }
