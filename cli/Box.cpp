@@ -62,6 +62,17 @@ std::string RouterName(const std::string& szBrand, const std::string& szModel, c
     return szName;
 }
 
+std::optional<std::string> OtherLimit(const std::string& szBrand, const std::string& szModel,
+                                      const std::string& szVersion, int nMaxRules) {
+    int nKnown = -1;
+    if (RouterUpnpDB(szBrand, szModel, szVersion).GetMaxRule(nKnown) && nKnown == nMaxRules) {
+        return std::nullopt;
+    }
+    return fmt::format(
+        "the downloaded database says that this router holds {} rules; its word comes before what is recorded here",
+        nKnown);
+}
+
 std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, int nMaxRules) {
     const std::string szBrand = conf.szBrand;
     // The database has one record for all models of these two makers.
@@ -70,14 +81,7 @@ std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, in
     if (!writer.Init() || !writer.SetSupport("yes") || !writer.SetMaxRule(nMaxRules) || !writer.Sync()) {
         return "the number of rules could not be recorded in /etc/portforward/router_upnp.db.user";
     }
-    int nKnown = -1;
-    if (!RouterUpnpDB(szBrand, conf.szModel, conf.szVersion).GetMaxRule(nKnown) || nKnown != nMaxRules) {
-        return fmt::format(
-            "the downloaded database says that this router holds {} rules; its word comes before "
-            "--max-rules",
-            nKnown);
-    }
-    return std::nullopt;
+    return OtherLimit(szBrand, conf.szModel, conf.szVersion, nMaxRules);
 }
 
 }  // namespace tavo::cli

@@ -51,6 +51,10 @@ bool Put(char (&szField)[kSize], const std::string& szText) {
     return true;
 }
 
+// What the downloaded database says instead, where it has another limit for this router; it comes first.
+std::optional<std::string> OtherLimit(const std::string& szBrand, const std::string& szModel,
+                                      const std::string& szVersion, int nMaxRules);
+
 // Records in the user's own compatibility database how many rules a UPnP or NAT-PMP router holds, which
 // the library must know before it saves rules; 0: no limit is known. A message, or nothing when done.
 std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, int nMaxRules);

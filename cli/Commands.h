@@ -20,6 +20,10 @@ void OfferStatus(CLI::App& app, Request& request);
 void OfferDetect(CLI::App& app, Request& request);
 void OfferRouter(CLI::App& app, Request& request);
 void OfferRouters(CLI::App& app, Request& request);
+void OfferCompat(CLI::App& app, Request& request);
+void OfferTest(CLI::App& app, Request& request);
+void OfferReport(CLI::App& app, Request& request);
+void OfferDiag(CLI::App& app, Request& request);
 
 // A new command below app that takes the options of the commands above it, too.
 CLI::App* AddCommand(CLI::App& app, const std::string& szName, const std::string& szWhat);

@@ -24,12 +24,6 @@ struct Wish {
     int nMaxRules = -1;
 };
 
-struct Step {
-    int nPercent;
-    const char* szDoing;
-    const char* szFailed;  // what a failure without an error code means here
-};
-
 // In the order in which they come; the percentages go back once, the bar does not.
 constexpr Step kSteps[] = {
     {10, "preparing", "what was known of the router could not be cleared; the system log says why"},
@@ -40,15 +34,6 @@ constexpr Step kSteps[] = {
     {50, "trying to resolve a name", "names cannot be resolved"},
     {80, "asking the router what it is", "the router could not be asked; the system log says why"},
 };
-
-const Step& StepAt(int nPercent) {
-    for (const Step& step : kSteps) {
-        if (step.nPercent == nPercent) {
-            return step;
-        }
-    }
-    return kSteps[0];
-}
 
 struct Watch {
     Progress progress;
@@ -61,7 +46,7 @@ void ShowStep(const DetectResult* pResult, void* pData) {
         _exit(0);  // the child of detection that has nothing to look for
     }
     if (pResult != nullptr) {
-        pWatch->progress.Show(pResult->nProgress, StepAt(pResult->nProgress).szDoing);
+        pWatch->progress.Show(pResult->nProgress, StepAt(kSteps, pResult->nProgress).szDoing);
     }
 }
 
@@ -92,7 +77,7 @@ Reply Failed(const DetectResult& result) {
                         "names cannot be resolved; see to the name servers in /etc/resolv.conf or in the "
                         "router's settings, then detect again"};
         default:
-            return Failure(StepAt(result.nProgress).szFailed);
+            return Failure(StepAt(kSteps, result.nProgress).szFailed);
     }
 }
 

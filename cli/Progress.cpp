@@ -25,6 +25,12 @@ size_t Width() {
 
 }  // namespace
 
+const Step& StepAt(std::span<const Step> rgSteps, int nPercent) {
+    const auto pStep = std::find_if(rgSteps.begin(), rgSteps.end(),
+                                    [nPercent](const Step& step) { return step.nPercent == nPercent; });
+    return pStep == rgSteps.end() ? rgSteps.front() : *pStep;
+}
+
 Progress::Progress(bool blQuiet) : mBlQuiet(blQuiet), mBlTerminal(IsSmartTerminal(STDERR_FILENO)) {}
 
 Progress::~Progress() {

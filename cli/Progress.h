@@ -3,9 +3,21 @@
 // holds no text back in a buffer between two calls.
 #pragma once
 
+#include <span>
 #include <string>
 
 namespace tavo::cli {
+
+// One step of an operation that reports percentages.
+struct Step {
+    int nPercent;
+    const char* szDoing;
+    const char* szFailed;     // what a failure of it means
+    const char* szName = "";  // for scripts
+};
+
+// The step that begins at this percentage; the first one where none does.
+const Step& StepAt(std::span<const Step> rgSteps, int nPercent);
 
 class Progress {
 public:

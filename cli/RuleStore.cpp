@@ -2,6 +2,8 @@
 // Promises: see RuleStore.h.
 #include "RuleStore.h"
 
+#include <fmt/format.h>
+
 #include <CLI/StringTools.hpp>
 #include <algorithm>
 #include <array>
@@ -9,6 +11,7 @@
 #include <set>
 
 #include "Box.h"
+#include "Usage.h"
 
 namespace tavo::cli {
 
@@ -138,6 +141,16 @@ std::vector<Overlap> OverlapsOf(const Rules& rules) {
         }
     }
     return rgFound;
+}
+
+Reply NoSuchRule(const Rules& rules, const std::string& szId) {
+    std::vector<std::string> rgszIds;
+    for (const Rule& rule : rules) {
+        rgszIds.push_back(Clean(rule.szId));
+    }
+    return {.enExit = kUsage,
+            .szMessage = fmt::format("there is no rule {}; {}", Clean(szId),
+                                     rgszIds.empty() ? "none is stored" : "the rules are " + Join(rgszIds))};
 }
 
 }  // namespace tavo::cli

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "Answer.h"
 #include "libtavoportmap.h"
 
 namespace tavo::cli {
@@ -31,6 +32,9 @@ bool StoreRules(const Rules& rules);
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules);
 
 extern const char kUnreadable[];
+
+// Says which rules there are.
+Reply NoSuchRule(const Rules& rules, const std::string& szId);
 
 // The ports of a text like "80,443,5000-5010", in its order; nothing when it cannot be read.
 std::optional<std::vector<int>> ParsePorts(const std::string& szText);

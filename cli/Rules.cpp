@@ -123,16 +123,6 @@ Reply AddRule(Rule rule, bool blForce) {
     });
 }
 
-Reply NoSuchRule(const Rules& rules, const std::string& szId) {
-    std::vector<std::string> rgszIds;
-    for (const Rule& rule : rules) {
-        rgszIds.push_back(Clean(rule.szId));
-    }
-    return {.enExit = kUsage,
-            .szMessage = fmt::format("there is no rule {}; {}", Clean(szId),
-                                     rgszIds.empty() ? "none is stored" : "the rules are " + Join(rgszIds))};
-}
-
 enum class Change { kRemove, kEnable, kDisable };
 
 Reply ChangeRule(const std::string& szId, Change enChange, bool blForce) {

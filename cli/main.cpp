@@ -17,7 +17,7 @@ constexpr char kFooter[] =
     "  tavoportmap rules add web --router-port 443 --box-port 8443\n"
     "  tavoportmap save               write the rules to the router\n\n"
     "Exit codes: 0 done, 1 failed, 2 wrong arguments, 3 another operation is running,\n"
-    "4 the router refused some ports, 5 more rules than the router holds.\n\n"
+    "4 some ports were refused or are closed, 5 more rules than the router holds.\n\n"
     "With --json every answer, also to wrong arguments, is one JSON document on\n"
     "standard output: \"ok\", \"message\", \"warnings\" and what the command has to say.\n"
     "Files, the meaning of each status and what to do: man tavoportmap\n";
@@ -50,7 +50,11 @@ Reply Answer(int argc, char** argv, Request& request) {
     OfferRouters(app, request);
     OfferRules(app, request);
     OfferSave(app, request);
+    OfferTest(app, request);
     OfferStatus(app, request);
+    OfferCompat(app, request);
+    OfferReport(app, request);
+    OfferDiag(app, request);
     try {
         app.parse(argc, argv);
     } catch (const CLI::CallForHelp&) {

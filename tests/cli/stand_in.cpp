@@ -1,14 +1,17 @@
-// Saving and detection as a test wants them to end: preloaded before the library. Relies on TAVO_SAVE
-// ("result status limit limit2" or "result status ports") and TAVO_DETECT ("result error flags level upnp
-// natpmp max percent...", "child" at the end: the forked process returns, too). Promises: calls back as
-// the library does.
+// What only a router answers, as a test wants it: preloaded before the library. Relies on TAVO_SAVE ("result
+// status limit limit2" or "result status ports"), TAVO_DETECT ("result error flags level upnp natpmp max
+// percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result status brand support
+// max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged), TAVO_LAST ("upnp
+// brand", the last detection). Promises: calls back and logs as the library does.
 #include <sys/wait.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <sstream>
+#include <string>
 
 #include "libtavoportmap.h"
 
@@ -69,4 +72,52 @@ int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
     pfnCallback(pResult, pData);
     pResult->nProgress = nResult == 0 ? 100 : pResult->nProgress;
     return nResult;
+}
+
+int TLibTestUpnpCompatibility(int, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* pResult,
+                              void (*pfnCallback)(const __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT*, void*),
+                              void* pData, bool) {
+    std::istringstream wanted(std::getenv("TAVO_COMPAT"));
+    int nResult = -1;
+    int nMaxRule = 0;
+    std::string szBrand, szSupport;
+    wanted >> nResult >> pResult->nStatus >> szBrand >> szSupport >> nMaxRule;
+    for (int nPercent = 0; wanted >> nPercent;) {
+        pResult->nProgress = nPercent;
+        pfnCallback(pResult, pData);
+    }
+    if (std::strstr(std::getenv("TAVO_COMPAT"), "hang") != nullptr) {
+        pause();
+    }
+    if (szBrand != "-") {
+        Fill(pResult->szBrand, szBrand.c_str());
+        Fill(pResult->szModel, "R1");
+        Fill(pResult->szVersion, "1");
+        Fill(pResult->szSupport, szSupport.c_str());
+        pResult->nMaxRule = nMaxRule;
+        pResult->nProgress = 100;
+        pfnCallback(pResult, pData);
+    }
+    return nResult;
+}
+
+int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TAVO_LIBTAVOPORTMAP_ERR*, bool) {
+    std::istringstream wanted(std::getenv("TAVO_REACH"));
+    for (int i = 0; i < nRules && wanted >> rgRules[i].enTestStatus; ++i) {
+        std::string szWord;
+        if (rgRules[i].enTestStatus == 0 && wanted >> szWord) {
+            syslog(LOG_ERR, "%s:%d router_prots [%s] = %s", "src/x.cpp", 1, rgRules[i].szRouterPort, szWord.c_str());
+        }
+    }
+    return 0;
+}
+
+int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* pResult) {
+    const char* szWanted = std::getenv("TAVO_LAST");
+    std::istringstream wanted(szWanted == nullptr ? "" : szWanted);
+    std::string szBrand;
+    wanted >> pResult->enSupportUpnp >> szBrand;
+    Fill(pResult->szBrand, szBrand.c_str());
+    Fill(pResult->szModel, szBrand.empty() ? "" : "R1");
+    return 0;
 }

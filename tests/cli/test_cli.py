@@ -9,6 +9,7 @@ import os
 import pty
 import re
 import shutil
+import signal
 import subprocess
 import unittest
 
@@ -51,11 +52,12 @@ def describe(brand, model, version):
     put(f"{MODELS}/{brand}/{model}/{version}/router.des", '[global]\nsyntax version="1"\n')
 
 
-def on_terminal(*arguments, **environment):
+def on_terminal(*arguments, typed=b"", **environment):
     """Exit code and everything that a terminal would have got."""
     pid, fd = pty.fork()
     if pid == 0:
         os.execve(TOOL, [TOOL, *arguments], {**os.environ, "TERM": "xterm", **environment})
+    os.write(fd, typed)
     text = b""
     try:
         while chunk := os.read(fd, 4096):
@@ -122,7 +124,8 @@ class Tool(unittest.TestCase):
     def test_help_and_man_page_know_every_command_and_option(self):
         page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
         for command in ("", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
-                        "rules enable", "rules disable", "save", "status"):
+                        "rules enable", "rules disable", "save", "status", "compat", "test", "report", "diag", "diag parse-ports",
+                        "diag to-ports", "diag rules", "diag used-ports", "diag conflicts", "diag test", "diag set"):
             code, out, err = tool(*command.split(), "--help")
             self.assertEqual((code, err), (OK, ""), command)
             self.assertIn(command, page)
@@ -239,6 +242,7 @@ class Tool(unittest.TestCase):
     def test_the_bar_never_goes_back_and_ends_its_line(self):
         steps = "10 20 30 40 70 50 80"
         for command, environment in ((("save",), {"TAVO_SAVE": "-1 9 80/tcp"}),
+                                     (("compat", "--yes"), {"TAVO_COMPAT": "1 0 Acme no -1 10 20 30 60 40 50"}),
                                      (("detect",), {"TAVO_DETECT": f"-1 4 0 1 2 2 -1 {steps}"})):
             code, text = on_terminal(*command, LD_PRELOAD=STAND_IN, **environment)
             percents = [int(percent) for percent in re.findall(r"(\d+) %", text)]
@@ -313,6 +317,130 @@ class Tool(unittest.TestCase):
         code, out, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
         self.assertEqual(code, OK, err)
         self.expect("router show --show-password", OK, "user +admin\npassword +n3w\n")
+
+    # ---- router tests ---------------------------------------------------------------------------
+
+    def test_verdicts_of_the_compatibility_test(self):
+        whole = "10 20 30 60 40 50 70 80 90"
+        for answer, code, pattern, failed, held in (
+                (f"0 0 Zeta yes 32 {whole}", OK, "works(?s:.)*holds +32 rules\n(?s:.)*not recorded", None, 32),
+                (f"0 0 Zeta yes 60 {whole}", OK, "60 rules at least, as many as were tried", None, 60),
+                (f"0 0 - - 0 {whole}", OK, "nothing can be recorded of it", None, None),
+                ("1 0 Zeta no -1 10 20 30", FAILED, "did not take the test mappings(?s:.)*tavoportmap report", "add", None),
+                ("1 0 Zeta no -1 10 20 30 60", FAILED, "holds none of the mappings that it said yes to", "count", None),
+                ("1 0 Zeta no -1 10 20 30 60 40", FAILED, "did not take the mappings away", "delete", None),
+                ("1 18 - - 0 10 20 30 60 40 50", FAILED, "ports of deleted mappings are still open", "closed", None),
+                (f"1 0 Zeta no -1 {whole[:-3]}", FAILED, "ports of its mappings stay closed", "open", None),
+                ("-1 13 - - 0 10 20", FAILED, "no router answered that speaks UPnP", None, None),
+                ("-1 2 - - 0 10", BUSY, "another port-forwarding operation", None, None)):
+            self.expect("compat", code, pattern, LD_PRELOAD=STAND_IN, TAVO_COMPAT=answer)
+            told = self.json("compat", LD_PRELOAD=STAND_IN, TAVO_COMPAT=answer)[1]
+            self.assertEqual((told.get("failed_step"), told.get("max_rules"), told.get("recorded", False)),
+                             (failed, held, False), answer)
+        self.assertFalse(os.path.exists(f"{CONF}/router_upnp.db.user"))
+
+    def test_what_a_test_found_is_recorded_on_request_and_saving_goes_by_it(self):
+        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        passed = {"LD_PRELOAD": STAND_IN, "TAVO_COMPAT": "0 0 Zeta yes 1 10 90"}
+        failed = {"LD_PRELOAD": STAND_IN, "TAVO_COMPAT": "1 0 Zeta no -1 10 30"}
+        self.expect("compat --record", OK, "recorded: .*more than 1 rules is refused", **passed)
+        tool("rules", "add", "--router-port", "80")
+        tool("rules", "add", "--router-port", "81")
+        self.expect("save", TOO_MANY, "holds 1 rules and there are 2")
+        self.expect("compat --record", FAILED, "not recorded", **failed)
+        self.expect("router show", OK, "holds +1 rules")
+        self.expect("compat --yes", FAILED, "recorded: .*as unknown", **failed)
+        self.assertIn('support="no"', get(f"{CONF}/router_upnp.db.user"))
+        self.expect("compat --yes", OK, "database says that this router holds 1 rules", LD_PRELOAD=STAND_IN,
+                    TAVO_COMPAT="0 0 Acme yes 7 10 90")
+        for answer, recorded in ((b"y\n", True), (b"\n", False)):
+            code, text = on_terminal("compat", typed=answer, **passed)
+            self.assertEqual((code, "Record it?" in text, "\nrecorded: " in text.replace("\r", "")), (OK, True, recorded))
+
+    def test_a_signal_ends_a_test_that_hangs(self):
+        for number in (signal.SIGINT, signal.SIGTERM):
+            put("/tmp/upnp_test.progress", "upnp_add=\"processing\"\n")
+            with subprocess.Popen([TOOL, "compat", "--yes"], text=True, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+                                  env={**os.environ, "LD_PRELOAD": STAND_IN,
+                                       "TAVO_COMPAT": "0 0 Zeta yes 9 10 20 30 hang"}) as run:
+                self.assertIn("making test mappings", [run.stderr.readline() for _ in range(3)][2])
+                run.send_signal(number)
+                out, err = run.communicate(timeout=30)
+            self.assertEqual((run.returncode, out), (FAILED, ""))
+            self.assertIn("the test is stopped", err)
+            self.assertFalse(os.path.exists("/tmp/upnp_test.progress"))
+            self.assertFalse(os.path.exists(f"{CONF}/router_upnp.db.user"))
+
+    def test_a_running_test_is_left_alone_until_it_is_told_to_stop(self):
+        put("/tmp/upnp_test.progress", "upnp_add=\"failed\"\n")
+        self.expect("compat --stop", OK, "no compatibility test has mappings")
+        self.assertTrue(os.path.exists("/tmp/upnp_test.progress"))
+        with subprocess.Popen(["/usr/tavo/sbin/upnpd --debug -p"], executable="/usr/bin/python3",
+                              stdin=subprocess.PIPE) as daemon:  # waits for a program to run
+            self.expect("compat", BUSY, "running already", LD_PRELOAD=STAND_IN, TAVO_COMPAT="0 0 Zeta yes 9 10")
+            self.assertIsNone(daemon.poll())
+            self.expect("compat --stop", OK, "the test is stopped")
+            self.assertEqual(daemon.wait(timeout=10), -signal.SIGHUP)
+
+    def test_reachability_is_told_port_by_port_and_never_guessed(self):
+        self.expect("test", OK, "no rule to test")
+        tool("rules", "add", "web", "--router-port", "80,443", "--box-port", "8080,8443")
+        tool("rules", "add", "dns", "--router-port", "53", "--protocol", "all")
+        tool("rules", "add", "off", "--router-port", "99", "--disabled")
+        rows = [("1", "80", "8080", "tcp"), ("1", "443", "8443", "tcp"), ("2", "53", "53", "tcp"),
+                ("2", "53", "53", "udp"), ("3", "99", "99", "tcp")]
+        for answer, code, words in (("2 2 2 2 1", OK, ["came through"] * 4 + ["switched off"]),
+                                    ("2 3 0 NOLISTEN 0 UNKNOWN 1", REFUSED,
+                                     ["came through", "refused", "no program on this box", "nobody outside", "switched off"]),
+                                    ("2 0 UNKNOWN 2 2 1", FAILED, ["came", "nobody outside", "came", "came", "off"])):
+            environment = {"LD_PRELOAD": STAND_IN, "TAVO_REACH": answer}
+            got, told = self.json("test", **environment)
+            self.assertEqual(got, code)
+            self.assertEqual([(port["rule"], port["router_ports"], port["box_ports"], port["protocol"])
+                              for port in told["ports"]], rows)
+            for port, word in zip(told["ports"], words):
+                self.assertIn(word, port["reason"])
+            self.expect("test", code, "1 web +443/tcp to 8443", **environment)
+        # The library itself, with no checker named anywhere.
+        self.expect("test 2 3", FAILED, r"2 dns +53/udp +not tested(?s:.)*tavoportcheckd(?s:.)*\[portcheck\]")
+        self.expect("test 7", USAGE, "there is no rule 7; the rules are 1, 2, 3")
+
+    def test_a_report_says_what_it_lacks(self):
+        files = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule")
+        os.makedirs("/usr/tavo/bin", exist_ok=True)
+        settings = KNOWN % ("yes", "no")
+        put(ROUTER, settings)
+        known = {"LD_PRELOAD": STAND_IN, "TAVO_LAST": "1 Acme"}
+        self.expect("report", FAILED, "'tavoportmap detect' comes first")
+        self.expect("report", FAILED, "without an account of its pages", LD_PRELOAD=STAND_IN, TAVO_LAST="2 Acme")
+        for path in files:
+            if os.path.exists(path):
+                os.unlink(path)
+        self.expect("report", FAILED, "did not leave /tmp/upnp_test.progress, (?s:.)*router.log", **known)
+        for path in files:
+            put(path, "x\n")
+        put("/usr/tavo/bin/curl", "#!/bin/sh\nexit 22\n")
+        os.chmod("/usr/tavo/bin/curl", 0o755)
+        self.expect("report", FAILED, r"did not take it(?s:.)*stays in /tmp/Acme_\d+\.tgz", **known)
+        put("/usr/tavo/bin/curl", "#!/bin/sh\n")
+        told = self.json("report", **known)[1]
+        self.assertTrue(os.path.exists(told["archive"]), told)
+        self.assertEqual(get(ROUTER), settings)
+
+    def test_diagnostics_print_what_the_library_prints(self):
+        put(RULES, '[1]\nenabled="1"\nprotocol name="tcp"\nr_port="80-81"\ns_port="80-81"\nservice="\\x1b[2J"\n')
+        for arguments, code, pattern in (
+                ("diag parse-ports 80,443,8000-8002", OK, "^80 443 8000 8001 8002\n$"),
+                ("diag parse-ports 80,0", FAILED, "^80\n.*answered -1"),
+                ("diag to-ports 1,2,3,7", OK, "^1-3, 7\n$"),
+                ("diag to-ports 1,2,3,4,5,6,7,8,9,10,11", FAILED, "^out of range, i=10 MAX=10\n"),
+                ("diag rules", OK, r"^\[0\]\nenable=1\n(?s:.)*router ports=80 ,81 \n(?s:.)*service name=\\x1b\[2J\n"),
+                ("diag conflicts hoplink;5000-5001;tcp", OK, "^service name=hoplink\n(?s:.)*after delete(?s:.)*5000-5001"),
+                ("diag conflicts hoplink;5000", FAILED, "szProtocol:NULL"),
+                ("diag test hoplink;5000;tcp", OK, r"router_ports \[5000\]=not test\n"),
+                ("diag set hoplink;5000;tcp", OK, r"router_ports \[5000\]=not test\n")):
+            self.expect(arguments, code, pattern)
+        self.assertEqual(self.json("diag", "to-ports", "1,2")[1]["output"], "1-2\n")
 
     def test_models(self):
         os.makedirs(MODELS)

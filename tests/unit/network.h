@@ -21,7 +21,6 @@ struct Network {
     std::function<void()> fnInit;  // when a detection begins to look for UPnP
     int nUpnpPort = 0;             // the one last asked for
     std::optional<TAVO_UPNP_GATEWAY_MODEL> model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"};
-    bool blForkFails = false;
     int nServiceRestart = 0;
     int nRouterDbUpdates = 0;
     std::function<void()> fnRouterDbUpdate = [] {};

@@ -1,5 +1,4 @@
 // The stand-ins behind a scripted network; without one they pass on to the platform.
-#include <cerrno>
 #include <cstdio>
 #include <cstring>
 
@@ -48,13 +47,6 @@ int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL* pModel) {
     }
     *pModel = gPNetwork->model.value_or(TAVO_UPNP_GATEWAY_MODEL{});
     return gPNetwork->model ? 0 : -1;
-}
-pid_t TLIBCProcFork() {
-    if (gPNetwork != nullptr && gPNetwork->blForkFails) {
-        errno = EAGAIN;
-        return -1;
-    }
-    return Real("TLIBCProcFork", &TLIBCProcFork)();
 }
 int TLIBServiceRestart(const char* szName) {
     if (gPNetwork == nullptr) {

@@ -1,0 +1,115 @@
+// The table of tested ports. Relies on fmt. Promises: see Reach.h.
+#include "Reach.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+
+namespace tavo::cli {
+
+namespace {
+
+enum Status : int { kNotTested = 0, kDisabled = 1, kOpen = 2, kClosed = 3 };
+
+constexpr char kNobodyListens[] = "no program on this box listens there";
+constexpr char kNoJudge[] = "nobody outside could tell";
+
+constexpr char kAdviceClosed[] =
+    "closed from outside: have the rules been written ('tavoportmap save')? Then it is another router on the way "
+    "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
+constexpr char kAdviceNoJudge[] =
+    "whether a port is open can only be told from outside, by a port checker: tavoportcheckd on a host elsewhere, "
+    "named as url in [portcheck] of /etc/tavo/platform.conf. Where one is named it did not answer, or was asked too "
+    "much, or the port is a UDP port that a program has, whose protocol nobody knows";
+
+std::string StatusWord(int enStatus) {
+    constexpr const char* kWords[] = {"not tested", "disabled", "ok", "fail"};
+    return enStatus >= kNotTested && enStatus <= kClosed ? kWords[enStatus] : "unknown";
+}
+
+// The words of the log for the verdicts that could not be given, in their order: "UNKNOWN", "NOLISTEN".
+std::vector<std::string> LoggedWords(const std::string& szLog) {
+    constexpr std::string_view kBegin = "router_prots [";
+    constexpr std::string_view kMiddle = "] = ";
+    std::vector<std::string> rgszWords;
+    for (size_t nAt = szLog.find(kBegin); nAt != std::string::npos; nAt = szLog.find(kBegin, nAt + 1)) {
+        const size_t nWord = szLog.find(kMiddle, nAt) + kMiddle.size();
+        rgszWords.push_back(szLog.substr(nWord, szLog.find('\n', nWord) - nWord));
+    }
+    return rgszWords;
+}
+
+std::string PortWords(const PortVerdict& verdict) {
+    const std::string szPorts = verdict.szRouterPorts + "/" + verdict.szProtocol;
+    return Clean(verdict.szBoxPorts == verdict.szRouterPorts ? szPorts : szPorts + " to " + verdict.szBoxPorts);
+}
+
+std::string TableRow(const std::string& szRule, const std::string& szPort, const std::string& szVerdict,
+                     const std::string& szReason) {
+    return fmt::format("{:<16} {:<20} {:<10}  {}\n", szRule, szPort, szVerdict, szReason);
+}
+
+Json::Value ToJson(const PortVerdict& verdict) {
+    Json::Value js;
+    js["rule"] = verdict.szRule.empty() ? Json::Value() : Json::Value(verdict.szRule);
+    js["name"] = verdict.szName;
+    js["router_ports"] = verdict.szRouterPorts;
+    js["box_ports"] = verdict.szBoxPorts;
+    js["protocol"] = verdict.szProtocol;
+    js["status"] = StatusWord(verdict.enStatus);
+    js["reason"] = verdict.szReason;
+    return js;
+}
+
+}  // namespace
+
+void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) {
+    const std::vector<std::string> rgszWords = LoggedWords(szLog);
+    const auto nUnjudged = std::count_if(rgVerdicts.begin(), rgVerdicts.end(),
+                                         [](const PortVerdict& verdict) { return verdict.enStatus == kNotTested; });
+    // A log that does not fit the verdicts says nothing about any one of them.
+    const bool blFits = rgszWords.size() == static_cast<size_t>(nUnjudged);
+    size_t nWord = 0;
+    for (PortVerdict& verdict : rgVerdicts) {
+        switch (verdict.enStatus) {
+            case kNotTested:
+                verdict.szReason = blFits && rgszWords[nWord++] == "NOLISTEN" ? kNobodyListens : kNoJudge;
+                break;
+            case kDisabled:
+                verdict.szReason = "the rule is switched off";
+                break;
+            case kOpen:
+                verdict.szReason = "a connection from outside came through to this box";
+                break;
+            case kClosed:
+                verdict.szReason = "refused, without an answer, or another host answers";
+                break;
+            default:
+                verdict.szReason = "the tester gave no verdict that is known";
+        }
+    }
+}
+
+void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply) {
+    bool blClosed = false, blUnjudged = false, blNoJudge = false;
+    reply.jsAnswer["ports"] = Json::arrayValue;
+    reply.szBody +=
+        rgVerdicts.empty() ? "" : Paint(Ink::kBold, TableRow("rule", "port", "verdict", "reason"), STDOUT_FILENO);
+    for (const PortVerdict& verdict : rgVerdicts) {
+        const std::string szRule = verdict.szRule + (verdict.szRule.empty() ? "" : " ") + verdict.szName;
+        reply.szBody += TableRow(Clean(szRule), PortWords(verdict), StatusWord(verdict.enStatus), verdict.szReason);
+        reply.jsAnswer["ports"].append(ToJson(verdict));
+        blClosed = blClosed || verdict.enStatus == kClosed;
+        blUnjudged = blUnjudged || verdict.enStatus == kNotTested;
+        blNoJudge = blNoJudge || verdict.szReason == kNoJudge;
+    }
+    if (blNoJudge) {
+        reply.rgszWarnings.emplace_back(kAdviceNoJudge);
+    }
+    if (blClosed) {
+        reply.rgszWarnings.emplace_back(kAdviceClosed);
+    }
+    reply.enExit = blClosed ? kRefused : blUnjudged ? kFailed : kOk;
+}
+
+}  // namespace tavo::cli
