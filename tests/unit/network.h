@@ -1,13 +1,17 @@
-// A network that a test scripts: what the checks, the router and the services answer. The stand-ins are in
-// test_network.cpp; while gPNetwork is null, the real platform answers.
+// A network that a test scripts: what the checks, the router, the services and the test client answer. The
+// stand-ins are in test_network.cpp, test_relay_router.cpp (the router's table) and test_router_tests.cpp
+// (the test client); while the pointer to one of these is null, the real platform answers.
 #pragma once
 
 #include <dlfcn.h>
 
 #include <functional>
+#include <map>
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "tavo/net.h"
 #include "tavo/upnp.h"
 
 // What the network answers while a test has one; without one the real platform answers.
@@ -28,6 +32,33 @@ struct Network {
     std::function<void()> fnAnnounce;  // what else happens when avahi restarts
 };
 extern Network* gPNetwork;
+
+// The router's table and the box's interfaces, while a test has them.
+struct Home {
+    std::vector<TAVO_UPNP_PORT_MAPPING> mappings;
+    std::vector<TAVO_NET_CARD> cards = {{"tun0", "10.9.9.2", "255.255.255.0"},
+                                        {"eth0", "192.168.1.7", "255.255.255.0"}};
+    std::function<void()> fnOnListing;  // called when the table is read from its start
+};
+extern Home* gPHome;
+
+// The answers of the test client; a step's word is what stands in the progress file once it is asked for.
+struct TestClient {
+    int nWanted = 10;  // mappings that the caller is to ask for
+    std::map<std::string, int> mapAnswers;
+    std::map<std::string, std::string> mapWords;
+    std::vector<std::string> rgszCalls;
+    int nTester = 0;
+    std::vector<int> rgVerdicts;
+    std::vector<std::string> rgszRouterLog;
+
+    int Call(const std::string& szCall, int nDefault) {
+        rgszCalls.push_back(szCall);
+        const auto it = mapAnswers.find(szCall);
+        return it == mapAnswers.end() ? nDefault : it->second;
+    }
+};
+extern TestClient* gPClient;
 
 // The platform's own function behind a stand-in.
 template <typename Function>

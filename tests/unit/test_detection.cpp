@@ -28,13 +28,6 @@ constexpr char kRouterConfBak[] = "/etc/portforward/router.conf.bak";
 constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
 constexpr char kAnnounced[] = "/tmp/airport.tcp.local";
 
-bool IsLockFree(const char* szPath) {
-    int fd = -1;
-    const bool blFree = lock_file(szPath, fd) == 1;
-    unlock_file(fd);
-    return blFree;
-}
-
 class Detection : public testing::Test {
 protected:
     void SetUp() override {

@@ -5,21 +5,13 @@
 #include "InitState.h"
 #include "RuleConflicts.h"
 #include "network.h"
-#include "tavo/net.h"
 #include "world.h"
+
+Home* gPHome = nullptr;
 
 namespace {
 
-using Mappings = std::vector<TAVO_UPNP_PORT_MAPPING>;
 using Lines = std::vector<std::string>;
-
-// The router's table and the box's interfaces, while a test has them.
-struct Home {
-    Mappings mappings;
-    std::vector<TAVO_NET_CARD> cards = {{"tun0", "10.9.9.2", "255.255.255.0"},
-                                        {"eth0", "192.168.1.7", "255.255.255.0"}};
-};
-Home* gPHome = nullptr;
 
 constexpr char kUpnpConf[] =
     "[192.168.1.1]\nbrand=Acme\nmodel=R1\nversion=1.0\nsupport_router_upnp=yes\nsupport_router_natpmp=no\n";
@@ -43,6 +35,9 @@ int TAVONetGetCard1(int nIndex, TAVO_NET_CARD* pCard) {
 int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
     if (gPHome == nullptr) {
         return Real("TAVOUpnpPortMappingGet", &TAVOUpnpPortMappingGet)(nIndex, pMapping);
+    }
+    if (nIndex == 0 && gPHome->fnOnListing) {
+        gPHome->fnOnListing();
     }
     if (static_cast<size_t>(nIndex) >= gPHome->mappings.size()) {
         return 713;

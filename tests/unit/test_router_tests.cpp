@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include <csignal>
-#include <map>
 
 #include "libtavoportmap.h"
 #include "network.h"
@@ -15,28 +14,13 @@
 #include "tavo/upnptest.h"
 #include "world.h"
 
+TestClient* gPClient = nullptr;
+
 namespace {
 
 using TestResult = __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
 
 constexpr char kProgress[] = "/tmp/upnp_test.progress";
-
-// The answers of the test client; a step's word is what stands in the progress file once it is asked for.
-struct TestClient {
-    std::map<std::string, int> mapAnswers;
-    std::map<std::string, std::string> mapWords;
-    std::vector<std::string> rgszCalls;
-    int nTester = 0;
-    std::vector<int> rgVerdicts;
-    std::vector<std::string> rgszRouterLog;
-
-    int Call(const std::string& szCall, int nDefault) {
-        rgszCalls.push_back(szCall);
-        const auto it = mapAnswers.find(szCall);
-        return it == mapAnswers.end() ? nDefault : it->second;
-    }
-};
-TestClient* gPClient = nullptr;
 
 void Put(const char* szStep, const std::string& szWord) {
     TLIBCFileSetKeyValue(kProgress, szStep, szWord.c_str(), nullptr);
@@ -56,7 +40,7 @@ int TAVOUPnPAddTest(int nRules) {
         return Real("TAVOUPnPAddTest", &TAVOUPnPAddTest)(nRules);
     }
     Work("upnp_add");
-    return gPClient->Call("add", nRules == 10 ? 0 : -1);
+    return gPClient->Call("add", nRules == gPClient->nWanted ? 0 : -1);
 }
 int TAVOUPnPCountMaxRule() {
     return gPClient == nullptr ? Real("TAVOUPnPCountMaxRule", &TAVOUPnPCountMaxRule)() : gPClient->Call("count", 10);
@@ -105,6 +89,13 @@ int TAVOWriteLog(const char* szText, int nKind, int nLevel) {
     }
     gPClient->rgszRouterLog.push_back(std::string(szText).substr(std::string(szText).find(' ') + 1));
     return 0;
+}
+int TavoPortConnTestInit() {
+    if (gPClient == nullptr) {
+        return Real("TavoPortConnTestInit", &TavoPortConnTestInit)();
+    }
+    Write("/tmp/pfStatusRule", "");
+    return gPClient->Call("init", 0);
 }
 int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* rgStatus, int nRules) {
     if (gPClient == nullptr) {

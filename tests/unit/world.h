@@ -10,6 +10,8 @@
 #include <string>
 #include <vector>
 
+#include "libtavoportmap.h"
+
 // Every line that went to syslog, without its "file:line " prefix.
 extern std::vector<std::string> gLog;
 // What the next rename of this source path does: fail, once.
@@ -75,4 +77,12 @@ inline bool Logged(const std::string& szLine) {
         }
     }
     return false;
+}
+
+// Whether another process could take the lock now.
+inline bool IsLockFree(const char* szPath) {
+    int fd = -1;
+    const bool blFree = lock_file(szPath, fd) == 1;
+    unlock_file(fd);
+    return blFree;
 }

@@ -1,0 +1,629 @@
+// The relay service's entry points over real files: who keeps a port in rule.conf, every way to fail, the
+// classification of the router, and the diagnostics' printed forms. The router's table, its answers and the
+// port tester are stand-ins; daemons are played on the stage.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "OperationRules.h"
+#include "network.h"
+#include "stage.h"
+#include "tavo/core.h"
+#include "world.h"
+
+namespace {
+
+// The detection's child finds no gateway.
+bool gBlLostChild = false;
+
+}  // namespace
+
+extern "C" pid_t TLIBCProcFork() {
+    const pid_t pid = Real("TLIBCProcFork", &TLIBCProcFork)();
+    if (pid == 0 && gBlLostChild) {
+        gSzGateway.clear();
+    }
+    return pid;
+}
+
+namespace {
+
+using Lines = std::vector<std::string>;
+using Request = __tag_TAVO_PORTMAP_RULE;
+using Requests = std::vector<Request>;
+
+constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
+constexpr char kRouterConf[] = "/etc/portforward/router.conf";
+constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
+constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
+constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+constexpr int kUntouched = 9;
+
+std::string Conf(const std::string& szModel, const char* szUpnp, const char* szNatpmp) {
+    return "[192.168.1.1]\nbrand=\"Acme\"\nmodel=\"" + szModel + "\"\nversion=\"1.0\"\nsupport_router_upnp=\"" +
+           szUpnp + "\"\nsupport_router_natpmp=\"" + szNatpmp + "\"\n";
+}
+
+// "E tcp 80 80 hop HopLink; D all 5 5": enabled or not, protocol, router and box ports, service and its id.
+std::string Stored(const std::string& szRules) {
+    std::string szText;
+    std::istringstream rules(szRules);
+    int nId = 7;
+    for (std::string szRule; std::getline(rules, szRule, ';'); ++nId) {
+        std::istringstream fields(szRule);
+        std::string szEnable, szProtocol, szRouter, szBox, szService, szId;
+        fields >> szEnable >> szProtocol >> szRouter >> szBox >> szService >> szId;
+        szText += "[" + std::to_string(nId) + "]\nenabled=\"" + (szEnable == "E" ? "1" : "0") + "\"\ns_port=\"" +
+                  szBox + "\"\nr_port=\"" + szRouter + "\"\nprotocol name=\"" + szProtocol + "\"\nservice_id=\"" +
+                  szId + "\"\nservice=\"" + szService + "\"\n\n";
+    }
+    return szText;
+}
+
+// What stands in rule.conf, in the same form with the numbers before it.
+std::string Kept() {
+    tavo::lib::RouterRules rules;
+    TLibGetRulesArrFromRuleConf(&rules.nRules, &rules.rgRules, nullptr, false, nullptr);
+    std::string szKept;
+    for (int i = 0; i < rules.nRules; ++i) {
+        const __tag_TAVO_ROUTER_RULE& rule = rules.rgRules[i];
+        szKept += szKept.empty() ? "" : "; ";
+        szKept += std::string(rule.szRuleID) + (rule.blEnable ? " E " : " D ") + rule.szProtocol;
+        for (const char* szField : {rule.szRouterPort, rule.szSrcPort, rule.szServiceName, rule.szServiceID}) {
+            szKept += *szField == '\0' ? "" : " ";
+            for (const char* pChar = szField; *pChar != '\0'; ++pChar) {
+                szKept += *pChar == ' ' ? "" : std::string(1, *pChar);
+            }
+        }
+    }
+    return szKept;
+}
+
+// "80,443/tcp 5/all"
+Requests Ask(const std::string& szRequests) {
+    Requests rgRequests;
+    std::istringstream words(szRequests);
+    for (std::string szWord; words >> szWord;) {
+        const size_t nSlash = szWord.find('/');
+        Request request = {kUntouched, "", tavo::lib::ToProtocolEnum(szWord.substr(nSlash + 1).c_str())};
+        tavo::lib::FillText(request.szPorts, szWord.substr(0, nSlash));
+        rgRequests.push_back(request);
+    }
+    return rgRequests;
+}
+
+std::string Statuses(const Requests& rgRequests) {
+    std::string szStatuses;
+    for (const Request& request : rgRequests) {
+        szStatuses += std::to_string(request.nTestConnStatus);
+    }
+    return szStatuses;
+}
+
+int Set(const char* szService, Requests& rgRequests, bool blTest = false) {
+    return TLibTavoPortMapRulesSet(szService, rgRequests.empty() ? nullptr : rgRequests.data(),
+                                   static_cast<int>(rgRequests.size()), blTest);
+}
+
+bool LockIsFree() {
+    return IsLockFree("/tmp/routerconf.lock");
+}
+
+Lines LastLines(size_t nLines) {
+    return {gLog.end() - static_cast<long>(std::min(nLines, gLog.size())), gLog.end()};
+}
+
+class RelayService : public testing::Test {
+protected:
+    void SetUp() override {
+        for (const char* szPath : {"/etc/portforward", "/var/lib/tavo/tasks", "/etc.defaults/portforward", kSystemConf,
+                                   "/tmp/pfStatusRule", "/tmp/airport.tcp.local", "/tmp/pfProgress"}) {
+            std::filesystem::remove_all(szPath);
+        }
+        Write("/etc/portforward/router_upnp.db",
+              "[Acme/R1/1.0]\nsupport=yes\nmax=32\n[AirPort//]\nsupport=yes\nmax=5\n[Acme/No/1.0]\nsupport=no\n");
+        Write(kRouterConf, Conf("R1", "yes", "no"));
+        Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
+        Write(kTool, "#!/bin/sh\n");
+        chmod(kTool, 0755);
+        mNetwork = Network();
+        mHome = Home();
+        mHome.mappings = {{5000, 80, "TCP", "192.168.1.9", "", 1, 0}, {5002, 80, "TCP", "192.168.1.7", "", 1, 0}};
+        mClient = TestClient();
+        mClient.nWanted = 60;
+        mClient.rgVerdicts = {2, 3, 0};
+        gPNetwork = &mNetwork;
+        gPHome = &mHome;
+        gPClient = &mClient;
+        gStage = Stage();
+        gStage.blOn = true;
+        gFnOnSleep = [] { unlink("/tmp/pfProgress"); };
+        gSzGateway = "192.168.1.1";
+        gLog.clear();
+    }
+    void TearDown() override {
+        gPNetwork = nullptr;
+        gPHome = nullptr;
+        gPClient = nullptr;
+        gStage = Stage();
+        gFnOnSleep = nullptr;
+        gFnOnConfSet = nullptr;
+        gSzGateway = "192.168.1.1";
+    }
+    Network mNetwork;
+    Home mHome;
+    TestClient mClient;
+};
+
+// ---- the merge --------------------------------------------------------------------------------------------
+
+TEST_F(RelayService, WhoKeepsAPort) {
+    const std::string szPartial = "failed, port is partial matched";
+    const struct {
+        const char* szStored;
+        const char* szRequest;
+        const char* szKept;  // null: refused, nothing changes
+        Lines lines;         // what a refusal logs
+    } rgCases[] = {
+        // the service's own enabled rules are replaced whole, its name taken to the letter
+        {"E tcp 80 80 hop; E tcp 81 81 Hop", "82/tcp", "1 E tcp 81 81 Hop; 2 E tcp 82 82 hop", {}},
+        // its disabled rules keep what it still asks for, and it goes without that
+        {"D tcp 80,443 80,443 hop", "443,8080/tcp", "1 D tcp 443 443 hop; 2 E tcp 8080 8080 hop", {}},
+        {"D tcp 80 80 hop", "80/tcp", "1 D tcp 80 80 hop", {}},
+        {"D tcp 80 80 hop", "81/tcp", "1 E tcp 81 81 hop", {}},
+        {"D tcp 80 80 hop", "80/all", "1 D tcp 80 80 hop; 2 E all 80 80 hop", {}},
+        // whoever maps a port already keeps it
+        {"E tcp 80 80", "80/tcp", "1 E tcp 80 80", {}},
+        {"E tcp 81 81", "80-82,80/tcp 81/udp", "1 E tcp 81 81; 2 E tcp 80,82,80 80,82,80 hop; 3 E udp 81 81 hop", {}},
+        {"E tcp 80 80 web W", "80/tcp 81/tcp", "1 E tcp 80 80 web W; 2 E tcp 81 81 hop", {}},
+        {"E all 80 80", "80/tcp 80/udp 80/all", "1 E all 80 80", {}},
+        {"E tcp 80 80", "80/all", "1 E tcp 80 80; 2 E all 80 80 hop", {}},
+        {"D tcp 80 80", "80/tcp", "1 D tcp 80 80; 2 E tcp 80 80 hop", {}},
+        {"E tcp 80-81 90-91", "82-83/tcp", "1 E tcp 80-81 90-91; 2 E tcp 82-83 82-83 hop", {}},
+        // and so do other hosts, against the service only
+        {"E tcp 5000 5000", "5001/tcp", "1 E tcp 5000 5000; 2 E tcp 5001 5001 hop", {}},
+        {"D tcp 5000 5000 hop", "5000,5002/tcp 5000/all 5000/udp", "1 E tcp 5002 5002 hop; 2 E udp 5000 5000 hop", {}},
+        // an empty request takes all of the service's rules away; what is left keeps its ports
+        {"E tcp 80 80 hop; E udp 9,10 9,10; D tcp 81 81 hop; D all 5 5 web",
+         "",
+         "1 E udp 9-10 9-10; 2 D all 5 5 web",
+         {}},
+        {"E tcp 80 80 hop", "", "", {}},
+        {"", "82-80/tcp", "1 E tcp 80-82 80-82 hop", {}},
+        // half an overlap decides nothing
+        {"E tcp 8080 80",
+         "80/tcp",
+         nullptr,
+         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
+        {"E tcp 80 8080",
+         "81/udp 80/tcp",
+         nullptr,
+         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=2) failed"}},
+        {"D tcp 80 81 hop",
+         "80/tcp",
+         nullptr,
+         {szPartial, "DeletePortsFromRules1(B->C) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
+        {"D tcp 80,81 80 hop",
+         "80/tcp",
+         nullptr,
+         {"begin, router port numbers=2 != box port numbers=1", "DeletePortsFromRules1(B->C) failed",
+          "DeletePortsFromRuleConf(input rules=1) failed"}},
+    };
+    for (const auto& c : rgCases) {
+        SCOPED_TRACE(std::string(c.szStored) + " <- " + c.szRequest);
+        SetUp();
+        Write(kRuleConf, Stored(c.szStored));
+        Requests rgRequests = Ask(c.szRequest);
+        EXPECT_EQ(Set("hop", rgRequests), c.szKept == nullptr ? -1 : 0);
+        if (c.szKept == nullptr) {
+            EXPECT_EQ(Read(kRuleConf), Stored(c.szStored));
+            EXPECT_EQ(gLog, c.lines);
+            EXPECT_FALSE(std::filesystem::exists(kSystemConf));
+        } else {
+            EXPECT_EQ(Kept(), c.szKept);
+            EXPECT_EQ(gLog.back(), "> reload tavorelayd");
+        }
+        EXPECT_EQ(Statuses(rgRequests), std::string(rgRequests.size(), '9'));
+        EXPECT_TRUE(LockIsFree());
+    }
+}
+
+TEST_F(RelayService, ANatpmpRouterIsNotAskedForItsTable) {
+    Write(kRouterConf, Conf("R1", "no", "yes"));
+    Write("/var/tmp/natpmp_portmap.remap", "");
+    Requests rgRequests = Ask("5000/tcp");
+    EXPECT_EQ(Set("hoplink", rgRequests), 0);
+    EXPECT_EQ(Kept(), "1 E tcp 5000 5000 hoplink HopLink");
+    EXPECT_EQ(mNetwork.nUpnpPort, 0);
+}
+
+// ---- saving and testing -------------------------------------------------------------------------------------
+
+TEST_F(RelayService, SavesUnderItsLockThenTestsAllThatWasAskedFor) {
+    Write(kRuleConf, Stored("E tcp 80 80"));
+    Requests rgRequests = Ask("80/tcp 5000/tcp 6000/udp");
+    EXPECT_EQ(Set("hop", rgRequests, true), 0);
+    EXPECT_EQ(Kept(), "1 E tcp 80 80; 2 E udp 6000 6000 hop");
+    EXPECT_EQ(Statuses(rgRequests), "231");
+    EXPECT_EQ(gLog, Lines({"> runnatpmpportmapping=no", "> runupnpportmapping=no", "> write /etc/portforward/rule.conf",
+                           "> runupnpportmapping=yes", "> exec /usr/tavo/sbin/upnpd", "upnp daemon is alive now",
+                           "upnpd checking is done", "> ask tavorelayd, still locked", "> reload tavorelayd"}));
+    EXPECT_EQ(mClient.rgszCalls, Lines({"init", "test"}));
+    mClient.rgszCalls.clear();
+    Requests rgNone;
+    EXPECT_EQ(Set("hop", rgNone, true), 0);
+    EXPECT_EQ(mClient.rgszCalls, Lines());
+}
+
+struct SetFault {
+    const char* szWhat;
+    std::function<void()> fnSpoil;
+    int nResult;
+    Lines lines;  // the last ones
+    bool blSaved;
+};
+
+TEST_F(RelayService, EachStepThatFails) {
+    const std::string szOld = Stored("E tcp 80 80; E tcp 81 81 hop");
+    Requests rgRequests;
+    const Lines noState = {"cannot get gateway router ip", "get gateway ip failed", "GetInitState() failed"};
+    const SetFault rgFaults[] = {
+        {"lock held",
+         [] { TLibTavoPortMapLock(); },
+         2,
+         {"PortForwarding conflict = /tmp/routerconf.lock, other user is doing portforwarding"},
+         false},
+        {"no gateway", [] { gSzGateway.clear(); }, -1, noState, false},
+        {"never detected",
+         [] { std::filesystem::remove(kRouterConf); },
+         1,
+         {"file=/etc/portforward/router.conf not exists", "Not initialized portforwarding"},
+         false},
+        {"an odd cache",
+         [] {
+             std::filesystem::remove(kRouterConf);
+             Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"odd\"\n");
+         },
+         -1,
+         {"invalid szValue=odd", "failed, state is unknown"},
+         false},
+        {"a manual router",
+         [] { Write(kRouterConf, Conf("R1", "no", "no")); },
+         -1,
+         {"Can not set rules for manual router"},
+         false},
+        {"a rule without ports",
+         [] { Write(kRuleConf, "[1]\nenabled=\"1\"\nprotocol name=\"tcp\"\n"); },
+         -1,
+         {"get rule src port failed", "GetRulePort() failed", "PF_CONF::ToArray() failed",
+          "TLibGetRulesArrFromRuleConf() failed"},
+         false},
+        {"a rule of another protocol",
+         [] { Write(kRuleConf, Stored("E TCP 80 80")); },
+         -1,
+         {"Bad parameter, szProtocol=TCP", "ToProtocolEnum([0]=-1) failed",
+          "CreateOperationRulesArray(ruleConf) failed"},
+         false},
+        {"no port asked for",
+         [&] { rgRequests = Ask("0/tcp"); },
+         -1,
+         {"invalid port no [0]", "TLibParsePorts() for routerPort failed", "CreateOperationRulesArray(rgRules) fail"},
+         false},
+        {"a router that is gone",
+         [this] { mNetwork.nUpnpInit = 1; },
+         -1,
+         {"GetUsedRouterPortList() failed", "DeleteConflictPortsForUPnPRouter() failed"},
+         false},
+        {"a gateway that goes",
+         [this] { mHome.fnOnListing = [] { gSzGateway.clear(); }; },
+         -1,
+         {"GetGatewayIP() failed", "get gateway ip failed"},
+         false},
+        {"rule.conf cannot be written",
+         [] { gStage.szFail = "write"; },
+         -1,
+         {"can not sync rules to file", "save rule failed"},
+         false},
+        {"no daemon", [] { gStage.szFail = "exec"; }, -1, {"upnp daemon start failed", "save rule failed"}, true},
+        {"a refusing router",
+         [] { Write("/var/tmp/upnp_portmap.status", "82/tcp=718\n"); },
+         -1,
+         {"upnp port conflict", "save rule failed"},
+         true},
+        {"no tester",
+         [this] { mClient.mapAnswers["init"] = -1; },
+         -1,
+         {"TavoPortConnTestInit() failed", "test rule init failed"},
+         true},
+        {"no answer",
+         [this] { mClient.nTester = -1; },
+         -1,
+         {"TavoPortConnTest() failed", "test port connection failed"},
+         true},
+    };
+    for (const SetFault& fault : rgFaults) {
+        SCOPED_TRACE(fault.szWhat);
+        SetUp();
+        Write(kRuleConf, szOld);
+        rgRequests = Ask("82/tcp");
+        fault.fnSpoil();
+        const std::string szBefore = Read(kRuleConf);
+        EXPECT_EQ(Set("hop", rgRequests, true), fault.nResult);
+        EXPECT_EQ(LastLines(fault.lines.size()), fault.lines);
+        if (fault.blSaved) {
+            EXPECT_EQ(Kept(), "1 E tcp 80 80; 2 E tcp 82 82 hop");
+        } else {
+            EXPECT_EQ(Read(kRuleConf), szBefore);
+        }
+        EXPECT_EQ(Statuses(rgRequests), "9");
+        if (fault.nResult == 2) {
+            EXPECT_FALSE(LockIsFree());
+            TLibTavoPortMapUnLock();
+        }
+        EXPECT_TRUE(LockIsFree());
+    }
+}
+
+TEST_F(RelayService, RefusesArgumentsBeforeTheLock) {
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    Request request = {};
+    EXPECT_EQ(TLibTavoPortMapRulesSet(nullptr, nullptr, -1, true), -1);
+    EXPECT_EQ(TLibTavoPortMapRulesSet("", nullptr, -1, true), -1);
+    EXPECT_EQ(TLibTavoPortMapRulesSet("hop", &request, -1, true), -1);
+    EXPECT_EQ(TLibTavoPortMapRulesSet("hop", nullptr, 1, true), -1);
+    EXPECT_EQ(gLog, Lines({"Bad parameter, szServiceName is NULL", "Bad parameter, szServiceName is empty",
+                           "Bad parameter, 0 > nRules=-1", "Bad parameter, nRules=1, but rgRules is NULL"}));
+    TLibTavoPortMapUnLock();
+}
+
+TEST_F(RelayService, MemoryThatRunsOutLosesNoRule) {
+    const std::string szOld = Stored("E tcp 80 80; D tcp 82 82 hop");
+    const std::string szConf = Read(kRouterConf);
+    std::set<std::string> said;
+    RunOutOfMemory([&](const auto& fnArm) {
+        gStage = Stage();
+        gStage.blOn = true;
+        gLog.clear();
+        Write(kRuleConf, szOld);
+        Requests rgRequests = Ask("82,83/tcp");
+        fnArm();
+        const int nResult = Set("hop", rgRequests, true);
+        gNGoodAllocations = -1;
+        EXPECT_TRUE(nResult == 0 || (nResult == -1 && gBlAllocationFailed)) << nResult;
+        EXPECT_TRUE((nResult != 0 && Read(kRuleConf) == szOld) ||
+                    Kept() == "1 E tcp 80 80; 2 D tcp 82 82 hop; 3 E tcp 83 83 hop")
+            << Read(kRuleConf);
+        EXPECT_EQ(Statuses(rgRequests), nResult == 0 ? "2" : "9");
+        EXPECT_EQ(Read(kRouterConf), szConf);
+        EXPECT_TRUE(LockIsFree());
+        said.insert(gLog.begin(), gLog.end());
+    });
+    for (const char* szLine : {"GetInitState() failed", "CreateOperationRulesArray(ruleConf) failed",
+                               "save rule failed", "test port connection failed"}) {
+        EXPECT_TRUE(said.contains(szLine)) << szLine;
+    }
+#ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
+    EXPECT_TRUE(said.contains("CreateRulesArray() failed"));
+#endif
+}
+
+// ---- the router classified ------------------------------------------------------------------------------------
+
+// What is kept of the router: "settings UPNP NATPMP", "manual BRAND/MODEL/VERSION", "tested SUPPORT MAX".
+std::string Known() {
+    std::string szKnown;
+    const auto fnRead = [](const char* szPath, const char* szSection, const char* szKey) {
+        char szValue[64] = {};
+        TLIBCFileGetSectionValue(szPath, szSection, szKey, szValue, sizeof(szValue));
+        return std::string(szValue);
+    };
+    const std::string szCache = SZF_DETECT_MANUAL_CACHE;
+    if (std::filesystem::exists(kRouterConf)) {
+        szKnown += "settings " + fnRead(kRouterConf, "192.168.1.1", "support_router_upnp") + " " +
+                   fnRead(kRouterConf, "192.168.1.1", "support_router_natpmp") + ";";
+    }
+    if (fnRead(szCache.c_str(), "192.168.1.1", "router_detect") == "manual") {
+        szKnown += "manual " + fnRead(szCache.c_str(), "192.168.1.1", "brand") + "/" +
+                   fnRead(szCache.c_str(), "192.168.1.1", "model") + "/" +
+                   fnRead(szCache.c_str(), "192.168.1.1", "version") + ";";
+    }
+    if (!Read(kUserDb).empty()) {
+        szKnown += "tested " + fnRead(kUserDb, "Acme/New/2", "support") + " " + fnRead(kUserDb, "Acme/New/2", "max");
+    }
+    return szKnown;
+}
+
+struct DetectCase {
+    const char* szWhat;
+    std::function<void()> fnSetUp;
+    int nResult;
+    Lines lines;  // the last ones
+    const char* szKnown;
+};
+
+TEST_F(RelayService, ClassifiesTheRouterOnce) {
+    const std::string szDone = "TLibTavoPortMapRouterDetect() success: ";
+    const auto fnUnknown = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "New", "2"}; };
+    const auto fnBroken = [&] {
+        fnUnknown();
+        mClient.mapAnswers["modify"] = -1;
+    };
+    const auto fnNoSettings = [] { gFnOnConfSet = [] { return -1; }; };
+    const DetectCase rgCases[] = {
+        {"known by its settings",
+         [] { Write(kRouterConf, Conf("R1", "no", "yes")); },
+         0,
+         {szDone + "upnp/natpmp"},
+         "settings no yes;"},
+        {"manual by its settings",
+         [] { Write(kRouterConf, Conf("R1", "no", "no")); },
+         1,
+         {szDone + "manual"},
+         "settings no no;"},
+        {"manual by the cache",
+         [] { SetDetectManualCache("192.168.1.1", "a", "b", "c"); },
+         1,
+         {szDone + "manual"},
+         "manual a/b/c;"},
+        {"an odd cache",
+         [] { Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nbrand=\"a\"\n"); },
+         -1,
+         {"TLibTavoPortMapRouterDetect() failed, state=0"},
+         ""},
+        {"odd settings",
+         [] { Write(kRouterConf, Conf("R1", "Yes", "no")); },
+         -1,
+         {"GetInitState() failed"},
+         "settings Yes no;"},
+        {"no gateway", [] { gSzGateway.clear(); }, -1, {"cannot get gateway router ip", "get gateway ip failed"}, ""},
+        {"lock held", [] { TLibTavoPortMapLock(); }, 2, {"TLibTavoPortMapRouterDetect() is busy"}, ""},
+        {"UPnP", [] {}, 0, {"can not read router sdk version", "upgrade db fail"}, "settings yes no;"},
+        {"NAT-PMP",
+         [this] {
+             mNetwork.nUpnpInit = 1;
+             mNetwork.szAnnounced = "[192.168.1.1]\nname=\"Den\"\n";
+         },
+         0,
+         {"upgrade db fail", "init UPnP faild"},
+         "settings no yes;"},
+        {"neither", [this] { mNetwork.model.reset(); }, 1, {szDone + "manual"}, "manual //;"},
+        {"UPnP that is known not to work",
+         [this] {
+             mNetwork.model = {{"Acme", "No", "1.0"}};
+         },
+         1,
+         {szDone + "manual"},
+         "manual Acme/No/1.0;"},
+        {"no detection", [this] { mNetwork.nWan = -1; }, -1, {"Can not connect to WAN", "TLibDetectRouter failed"}, ""},
+        {"no settings written", fnNoSettings, -1, {"sync config failed", "TLibSetRouterConf(192.168.1.1) failed"}, ""},
+        {"it works", fnUnknown, 0, {szDone + "(comp) upnp/natpmp"}, "settings yes no;tested yes 10"},
+        {"nobody had tested it",
+         [&] {
+             fnUnknown();
+             Write(kRouterConf, Conf("R1", "unknown", "no"));
+         },
+         0,
+         {szDone + "(comp) upnp/natpmp"},
+         "settings yes no;tested yes 10"},
+        {"it does not work", fnBroken, 1, {szDone + "(comp) manual"}, "manual Acme/New/2;tested no -1"},
+        {"another test runs",
+         [&] {
+             fnUnknown();
+             gStage.alive.insert("/usr/tavo/sbin/upnpd --debug -p");
+         },
+         -1,
+         {"TLibTestUpnpCompatibility() failed"},
+         ""},
+        {"it works, no settings written",
+         [&] {
+             fnUnknown();
+             fnNoSettings();
+         },
+         -1,
+         {"TLibSetRouterConf(192.168.1.1) failed"},
+         "tested yes 10"},
+        {"no record written",
+         [&] {
+             fnUnknown();
+             std::filesystem::create_directories(std::string(kUserDb) + "/x");
+         },
+         -1,
+         {"TLibWriteRecordIntoUpnpDB() failed"},
+         ""},
+        {"no cache written",
+         [&] {
+             fnBroken();
+             std::filesystem::create_directories(SZF_DETECT_MANUAL_CACHE + "/x");
+         },
+         -1,
+         {"Sync() failed", "set detect cache failed"},
+         "tested no -1"},
+    };
+    for (const DetectCase& c : rgCases) {
+        SCOPED_TRACE(c.szWhat);
+        TearDown();
+        SetUp();
+        std::filesystem::remove(kRouterConf);
+        c.fnSetUp();
+        gLog.clear();
+        const int nResult = TLibTavoPortMapRouterDetect();
+        EXPECT_EQ(nResult, c.nResult);
+        std::erase_if(gLog, [](const std::string& szLine) { return szLine.starts_with("> "); });
+        EXPECT_EQ(LastLines(c.lines.size()), c.lines);
+        EXPECT_EQ(Known(), c.szKnown);
+        EXPECT_EQ(LockIsFree(), nResult != 2);
+        if (nResult == 2) {
+            TLibTavoPortMapUnLock();
+        }
+        // The verdict stands: the next call asks nobody.
+        if (nResult == 0 || nResult == 1) {
+            mNetwork.nWan = -1;
+            EXPECT_EQ(TLibTavoPortMapRouterDetect(), nResult);
+        }
+    }
+}
+
+TEST_F(RelayService, TheDetectionsChildComesBackWithoutTheLock) {
+    std::filesystem::remove(kRouterConf);
+    std::filesystem::remove("/tmp/child_result");
+    const pid_t pidSelf = getpid();
+    bool blLocked = false;
+    gFnOnConfSet = [&] {
+        blLocked = !LockIsFree();
+        return 1;
+    };
+    gBlLostChild = true;
+    const int nResult = TLibTavoPortMapRouterDetect();
+    gBlLostChild = false;
+    if (getpid() != pidSelf) {
+        Write("/tmp/child_result", std::to_string(nResult) + gLog.back());
+        _exit(0);
+    }
+    EXPECT_EQ(nResult, 0);
+    EXPECT_EQ(Read("/tmp/child_result"), "-1TLibDetectRouter failed");
+    EXPECT_TRUE(blLocked);
+    EXPECT_TRUE(LockIsFree());
+}
+
+// ---- the printed forms ------------------------------------------------------------------------------------------
+
+TEST_F(RelayService, PrintedTestsAndSets) {
+    const std::string szRead = "service name=hop\nports:80 szProtocol:tcp\nports:81-82 szProtocol:udp\n";
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnSpoil;
+        int (*pfnCall)(const char*);
+        const char* szRequest;
+        int nResult;
+        std::string szPrinted;
+        const char* szKept;
+    } rgCases[] = {
+        {"test", [] {}, &TestFuncTestRules, "hop;80;tcp;81-82;udp", 0,
+         szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n", ""},
+        {"no tester", [this] { mClient.mapAnswers["init"] = -1; }, &TestFuncTestRules, "hop;80;tcp;81-82;udp", -1,
+         szRead, ""},
+        {"no port", [] {}, &TestFuncTestRules, "hop;x;tcp", -1,
+         "service name=hop\nports:x szProtocol:tcp\nCreateOperationRulesArray(rgRules) failed\n", ""},
+        {"nothing to test", [] {}, &TestFuncTestRules, "hop", -1, "service name=hop\n", ""},
+        {"set", [] {}, &TestFuncSetRules, "hop;80;tcp;81-82;udp", 0,
+         szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n", "1 E tcp 80 80 hop; 2 E udp 81-82 81-82 hop"},
+        {"never detected", [] { std::filesystem::remove(kRouterConf); }, &TestFuncSetRules, "hop;80;tcp;81-82;udp", 0,
+         szRead + "router_ports [80]=not test\nrouter_ports [81-82]=not test\n", ""},
+        {"refused", [this] { mNetwork.nUpnpInit = 1; }, &TestFuncSetRules, "hop;80;tcp;81-82;udp", -1,
+         szRead + "TLibTavoPortMapRulesSet() failed\n", ""},
+        {"no protocol", [] {}, &TestFuncSetRules, "hop;80", -1, "service name=hop\nports:80 szProtocol:NULL\n", ""},
+    };
+    for (const auto& c : rgCases) {
+        SCOPED_TRACE(c.szWhat);
+        SetUp();
+        c.fnSpoil();
+        testing::internal::CaptureStdout();
+        EXPECT_EQ(c.pfnCall(c.szRequest), c.nResult);
+        EXPECT_EQ(testing::internal::GetCapturedStdout(), c.szPrinted);
+        EXPECT_EQ(Kept(), c.szKept);
+    }
+    EXPECT_EQ(TestFuncTestRules(nullptr), -1);
+    EXPECT_EQ(TestFuncSetRules(nullptr), -1);
+}
+
+}  // namespace
