@@ -23,6 +23,7 @@ void OfferRouters(CLI::App& app, Request& request);
 void OfferCompat(CLI::App& app, Request& request);
 void OfferTest(CLI::App& app, Request& request);
 void OfferReport(CLI::App& app, Request& request);
+void OfferService(CLI::App& app, Request& request);
 void OfferDiag(CLI::App& app, Request& request);
 
 // A new command below app that takes the options of the commands above it, too.

@@ -153,11 +153,6 @@ Reply Outcome(const TestResult& result, bool blPassed, int nLast, int nAsked) {
     return reply;
 }
 
-Reply AlreadyTesting() {
-    return {.enExit = kBusy,
-            .szMessage = "a compatibility test is running already; 'tavoportmap compat --stop' would end it"};
-}
-
 Reply Conclude(const TestResult& result, int nResult, int nLast, const Wish& wish, bool blJson) {
     Reply reply = nResult < 0 ? NotRun(result, nLast) : Outcome(result, nResult == 0, nLast, wish.nRules);
     reply.jsAnswer["passed"] = nResult < 0 ? Json::Value() : Json::Value(nResult == 0);

@@ -62,6 +62,11 @@ Reply Stopped(bool blEnded) {
                          "'tavoportmap status' shows when it has ended");
 }
 
+Reply AlreadyTesting() {
+    return {.enExit = kBusy,
+            .szMessage = "a compatibility test is running already; 'tavoportmap compat --stop' would end it"};
+}
+
 StopOnSignal::StopOnSignal(bool blJson, std::function<void()> fnPark) : mBlJson(blJson), mFnPark(std::move(fnPark)) {
     int rgFds[2] = {-1, -1};
     if (pipe2(rgFds, O_CLOEXEC) != 0) {

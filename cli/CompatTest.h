@@ -11,6 +11,8 @@ namespace tavo::cli {
 
 // A test, of any process, has mappings on the router now.
 bool IsTesting();
+// What whoever would start another one is told: a refused start ends the test that runs.
+Reply AlreadyTesting();
 // Ends it and waits until it has taken its mappings away; false when it still does so after some seconds.
 bool StopTest();
 // What became of a stopped test.

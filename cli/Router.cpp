@@ -3,62 +3,16 @@
 // command line; settings that could not be read are neither shown as empty nor overwritten.
 #include <fmt/format.h>
 
-#include <filesystem>
-
 #include "Box.h"
 #include "Commands.h"
 #include "Secret.h"
+#include "Settings.h"
 #include "Usage.h"
 #include "Verdict.h"
 
 namespace tavo::cli {
 
 namespace {
-
-using RouterConf = __tag_TAVO_ROUTER_CONF;
-
-constexpr char kConfFile[] = "/etc/portforward/router.conf";
-
-enum class Found { kYes, kNothing, kWithoutLimit, kBusy, kFailed };
-
-// Whether there are settings that nobody can read; the library deletes such a file when it is asked.
-bool IsUnreadable(const std::string& szGateway) {
-    std::error_code error;
-    bool blExist = false;
-    return std::filesystem::file_size(kConfFile, error) > 0 && !error &&
-           RouterConfReader(szGateway).IsSectionExist(blExist) == 0;
-}
-
-Found ReadSettings(const std::string& szGateway, RouterConf& conf) {
-    if (IsUnreadable(szGateway)) {
-        return Found::kFailed;
-    }
-    auto enError = TAVO_LIBTAVOPORTMAP_ERR_NONE;
-    const int nResult = TLibGetRouterConf(szGateway.c_str(), &conf, &enError, true);
-    if (nResult >= 0) {
-        return nResult == 0 ? Found::kYes : Found::kNothing;
-    }
-    if (enError == TAVO_LIBTAVOPORTMAP_ERR_CONFLICT) {
-        return Found::kBusy;
-    }
-    // The limit is the last thing that is looked up, and the only one that may be missing.
-    const Way enWay = WayOf(conf.szSupportUpnp, conf.szSupportNatpmp);
-    return enWay == Way::kUpnp || enWay == Way::kNatpmp ? Found::kWithoutLimit : Found::kFailed;
-}
-
-// What keeps a command from going on; nothing when nothing does.
-std::optional<Reply> Obstacle(Found enFound) {
-    if (enFound == Found::kBusy) {
-        return Busy();
-    }
-    if (enFound != Found::kFailed) {
-        return std::nullopt;
-    }
-    return Failure(
-        fmt::format("{} cannot be read as settings; it was left as it is. 'tavoportmap detect --save' or a "
-                    "complete 'router set' after removing it starts anew",
-                    kConfFile));
-}
 
 // ---- show -----------------------------------------------------------------------------------------------
 
@@ -100,30 +54,26 @@ std::string ToText(const std::string& szGateway, const RouterConf& conf, bool bl
 }
 
 Reply Show(bool blShowPassword) {
-    const auto szGateway = Gateway();
-    if (!szGateway) {
-        return NoGateway();
+    const Settings settings = ReadSettings();
+    if (settings.obstacle) {
+        return *settings.obstacle;
     }
-    RouterConf conf = {};
     Reply reply;
-    reply.jsAnswer["gateway"] = *szGateway;
+    reply.jsAnswer["gateway"] = settings.szGateway;
     reply.jsAnswer["router"] = Json::Value();
-    const Found enFound = ReadSettings(*szGateway, conf);
-    if (const auto obstacle = Obstacle(enFound)) {
-        return *obstacle;
-    }
-    if (enFound == Found::kNothing) {
-        reply.szMessage = fmt::format(
-            "nothing is stored for the router {} yet; 'tavoportmap detect --save' finds out what it is", *szGateway);
+    if (settings.enFound == Found::kNothing) {
+        reply.szMessage =
+            fmt::format("nothing is stored for the router {} yet; 'tavoportmap detect --save' finds out what it is",
+                        settings.szGateway);
         return reply;
     }
-    if (enFound == Found::kWithoutLimit) {
+    if (settings.enFound == Found::kWithoutLimit) {
         reply.rgszWarnings.emplace_back(
             "nobody has recorded how many rules this router holds, so no rules can be saved; 'tavoportmap router "
             "set --max-rules NUMBER' records it (0: no limit is known)");
     }
-    reply.jsAnswer["router"] = ToJson(conf, blShowPassword);
-    reply.szBody = ToText(*szGateway, conf, blShowPassword);
+    reply.jsAnswer["router"] = ToJson(settings.conf, blShowPassword);
+    reply.szBody = ToText(settings.szGateway, settings.conf, blShowPassword);
     return reply;
 }
 
@@ -187,16 +137,12 @@ Reply Set(const Wish& wish) {
                     "  tavoportmap router set --user admin --conn-type http --conn-port 80\n"
                     "'tavoportmap router set --help' explains"};
     }
-    const auto szGateway = Gateway();
-    if (!szGateway) {
-        return NoGateway();
+    Settings settings = ReadSettings();
+    if (settings.obstacle) {
+        return *settings.obstacle;
     }
-    RouterConf conf = {};
-    const Found enFound = ReadSettings(*szGateway, conf);
-    if (const auto obstacle = Obstacle(enFound)) {
-        return *obstacle;
-    }
-    if (enFound == Found::kNothing) {
+    RouterConf& conf = settings.conf;
+    if (settings.enFound == Found::kNothing) {
         Put(conf.szSupportUpnp, "no");
         Put(conf.szSupportNatpmp, "no");
     }
@@ -212,7 +158,7 @@ Reply Set(const Wish& wish) {
     if (const Reply reply = ReadPassword(wish, conf); reply.enExit != kOk) {
         return reply;
     }
-    return StoreSettings(*szGateway, conf, wish.nMaxRules);
+    return StoreSettings(settings.szGateway, conf, wish.nMaxRules);
 }
 
 void OfferSet(CLI::App& router, Request& request) {

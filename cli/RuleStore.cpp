@@ -19,17 +19,6 @@ namespace {
 
 constexpr int kPorts = 65536;
 
-// How many rules the library itself can make out; negative when it cannot read the file.
-int CountReadable() {
-    int nRules = 0;
-    __tag_TAVO_ROUTER_RULE* pRules = nullptr;
-    if (TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr) != 0) {
-        return -1;
-    }
-    TLibFreeRulesArr(pRules);
-    return nRules;
-}
-
 bool ReadRule(RouterRuleConfReader& reader, Rule& rule) {
     reader.GetRuleServiceName(rule.szName);
     return reader.GetRuleID(rule.szId) != 0 && reader.GetRuleInfo(rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts,
@@ -81,7 +70,19 @@ std::optional<Rules> LoadRules() {
         rules.push_back(rule);
     }
     // An absent file and an unreadable one look the same to the reader, but not to this count.
-    return CountReadable() == static_cast<int>(rules.size()) ? std::optional(rules) : std::nullopt;
+    const auto rgRecords = LoadRecords();
+    return rgRecords && rgRecords->size() == rules.size() ? std::optional(rules) : std::nullopt;
+}
+
+std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords() {
+    int nRules = 0;
+    __tag_TAVO_ROUTER_RULE* pRules = nullptr;
+    if (TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr) != 0) {
+        return std::nullopt;
+    }
+    std::vector<__tag_TAVO_ROUTER_RULE> rgRecords(pRules, pRules + nRules);
+    TLibFreeRulesArr(pRules);
+    return rgRecords;
 }
 
 bool StoreRules(const Rules& rules) {
@@ -141,6 +142,18 @@ std::vector<Overlap> OverlapsOf(const Rules& rules) {
         }
     }
     return rgFound;
+}
+
+Json::Value ToJson(const Rule& rule) {
+    Json::Value js;
+    js["id"] = rule.szId;
+    js["enabled"] = rule.blEnabled;
+    js["protocol"] = rule.szProtocol;
+    js["router_ports"] = rule.szRouterPorts;
+    js["box_ports"] = rule.szBoxPorts;
+    js["name"] = rule.szName;
+    js["service_id"] = rule.szServiceId;
+    return js;
 }
 
 Reply NoSuchRule(const Rules& rules, const std::string& szId) {

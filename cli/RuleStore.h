@@ -26,12 +26,16 @@ using Rules = std::vector<Rule>;
 
 // Nothing when rule.conf cannot be read.
 std::optional<Rules> LoadRules();
+// The same as the library's own array, with its cuts and lent names.
+std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords();
 // False when they could not be written; the old ones are still there then.
 bool StoreRules(const Rules& rules);
 // As the library takes them; nothing when a value is too long for its record.
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules);
 
 extern const char kUnreadable[];
+
+Json::Value ToJson(const Rule& rule);
 
 // Says which rules there are.
 Reply NoSuchRule(const Rules& rules, const std::string& szId);

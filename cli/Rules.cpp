@@ -147,18 +147,6 @@ Reply ChangeRule(const std::string& szId, Change enChange, bool blForce) {
     });
 }
 
-Json::Value ToJson(const Rule& rule) {
-    Json::Value js;
-    js["id"] = rule.szId;
-    js["enabled"] = rule.blEnabled;
-    js["protocol"] = rule.szProtocol;
-    js["router_ports"] = rule.szRouterPorts;
-    js["box_ports"] = rule.szBoxPorts;
-    js["name"] = rule.szName;
-    js["service_id"] = rule.szServiceId;
-    return js;
-}
-
 std::string TableRow(const std::string& szId, const std::string& szState, const Rule& rule) {
     return fmt::format("{:<4} {:<8} {:<6} {:<20} {:<20} {}\n", Clean(szId), szState, Clean(rule.szProtocol),
                        Clean(rule.szRouterPorts), Clean(rule.szBoxPorts), Clean(rule.szName));

@@ -54,6 +54,7 @@ Reply Answer(int argc, char** argv, Request& request) {
     OfferStatus(app, request);
     OfferCompat(app, request);
     OfferReport(app, request);
+    OfferService(app, request);
     OfferDiag(app, request);
     try {
         app.parse(argc, argv);

@@ -1,8 +1,9 @@
 // What only a router answers, as a test wants it: preloaded before the library. Relies on TAVO_SAVE ("result
-// status limit limit2" or "result status ports"), TAVO_DETECT ("result error flags level upnp natpmp max
-// percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result status brand support
-// max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged), TAVO_LAST ("upnp
-// brand", the last detection). Promises: calls back and logs as the library does.
+// status limit limit2" or "result status ports", "write" at the end: the rules are stored), TAVO_DETECT ("result error
+// flags level upnp natpmp max percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result
+// status brand support max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged),
+// TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53", other hosts' mappings). Promises: calls
+// back and logs as the library does.
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -14,6 +15,7 @@
 #include <string>
 
 #include "libtavoportmap.h"
+#include "tavo/upnp.h"
 
 namespace {
 
@@ -21,14 +23,37 @@ void Fill(char (&szField)[TAVO_TEXT_SIZE], const char* szValue) {
     std::snprintf(szField, sizeof(szField), "%s", szValue);
 }
 
+bool Wants(const char* szVariable, const char* szWord) {
+    const char* szWanted = std::getenv(szVariable);
+    return szWanted != nullptr && std::strstr(szWanted, szWord) != nullptr;
+}
+
+void Store(int nRules, const __tag_TAVO_ROUTER_RULE* rgRules) {
+    RouterRuleConfWriter writer;
+    for (int i = 0; i < nRules; ++i) {
+        const __tag_TAVO_ROUTER_RULE& rule = rgRules[i];
+        writer.AddRule(rule.szRuleID, rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
+                       rule.szServiceID, rule.szServiceName);
+    }
+    writer.Sync();
+}
+
 }  // namespace
 
-int TLibSaveRules(const char*, int, __tag_TAVO_ROUTER_RULE*, bool, __tag_TAVO_ROUTER_SAVE_RULE_RESULT* pResult,
+int TLibSaveRules(const char*, int nRules, __tag_TAVO_ROUTER_RULE* rgRules, bool,
+                  __tag_TAVO_ROUTER_SAVE_RULE_RESULT* pResult,
                   void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData) {
     const char* szWanted = std::getenv("TAVO_SAVE");
     std::istringstream wanted(szWanted == nullptr ? "-1 0" : szWanted);
     int nResult = -1;
-    wanted >> nResult >> pResult->nStatus;
+    wanted >> nResult;
+    if (Wants("TAVO_SAVE", "write")) {
+        Store(nRules, rgRules);
+    }
+    if (pResult == nullptr) {
+        return nResult;
+    }
+    wanted >> pResult->nStatus;
     for (const int nPercent : {20, 40, 60, 80}) {
         pResult->nProgress = nPercent;
         pfnCallback(pResult, pData);
@@ -49,15 +74,18 @@ int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
     int nResult = -1;
     wanted >> nResult >> pResult->errCode >> pResult->nEnvFlags >> pResult->nPublicIPLevel >> pResult->enSupportUpnp >>
         pResult->enSupportNatpmp >> pResult->nMaxRule;
+    if (pfnCallback == nullptr) {
+        pfnCallback = [](const __tag_TAVO_ROUTER_DETECT_RESULT*, void*) {};
+    }
     for (int nPercent = 0; wanted >> nPercent;) {
         pResult->nProgress = nPercent;
         pfnCallback(pResult, pData);
     }
-    if (szWanted != nullptr && std::strstr(szWanted, "child") != nullptr) {
+    if (Wants("TAVO_DETECT", "child")) {
         const pid_t nPid = fork();
         if (nPid == 0) {
             // As the library's own child, which returns through both its ends.
-            if (std::strstr(szWanted, "callback") != nullptr) {
+            if (Wants("TAVO_DETECT", "callback")) {
                 pfnCallback(pResult, pData);
             }
             return -1;
@@ -82,11 +110,14 @@ int TLibTestUpnpCompatibility(int, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* 
     int nMaxRule = 0;
     std::string szBrand, szSupport;
     wanted >> nResult >> pResult->nStatus >> szBrand >> szSupport >> nMaxRule;
+    if (pfnCallback == nullptr) {
+        pfnCallback = [](const __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT*, void*) {};
+    }
     for (int nPercent = 0; wanted >> nPercent;) {
         pResult->nProgress = nPercent;
         pfnCallback(pResult, pData);
     }
-    if (std::strstr(std::getenv("TAVO_COMPAT"), "hang") != nullptr) {
+    if (Wants("TAVO_COMPAT", "hang")) {
         pause();
     }
     if (szBrand != "-") {
@@ -119,5 +150,29 @@ int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* pResult) {
     wanted >> pResult->enSupportUpnp >> szBrand;
     Fill(pResult->szBrand, szBrand.c_str());
     Fill(pResult->szModel, szBrand.empty() ? "" : "R1");
+    return 0;
+}
+
+int TAVOUpnpInit(int, int) {
+    return std::getenv("TAVO_USED") == nullptr ? 1 : 0;
+}
+
+int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
+    std::istringstream wanted(std::getenv("TAVO_USED"));
+    std::string szItem;
+    for (int i = 0; i <= nIndex; ++i) {
+        if (!(wanted >> szItem)) {
+            return 1;
+        }
+    }
+    *pMapping = {};
+    std::snprintf(pMapping->szProtocol, sizeof(pMapping->szProtocol), "%s", szItem.substr(0, 3).c_str());
+    std::snprintf(pMapping->szInternalClient, sizeof(pMapping->szInternalClient), "192.168.77.99");
+    pMapping->nExternalPort = std::atoi(szItem.c_str() + 4);
+    pMapping->nEnabled = 1;
+    return 0;
+}
+
+int TAVOUpnpPortMappingFind(int, const char*, TAVO_UPNP_PORT_MAPPING*) {
     return 0;
 }

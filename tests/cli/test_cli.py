@@ -7,6 +7,7 @@ import fcntl
 import json
 import os
 import pty
+import random
 import re
 import shutil
 import signal
@@ -71,7 +72,7 @@ def on_terminal(*arguments, typed=b"", **environment):
 class Tool(unittest.TestCase):
     def setUp(self):
         shutil.rmtree(MODELS, ignore_errors=True)
-        for path in (RULES, ROUTER, f"{CONF}/router_upnp.db.user"):
+        for path in (RULES, ROUTER, f"{CONF}/router_upnp.db.user", f"{CONF}/router_detect.cache"):
             if os.path.exists(path):
                 os.unlink(path)
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="1"\n')
@@ -125,7 +126,8 @@ class Tool(unittest.TestCase):
         page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
         for command in ("", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
                         "rules enable", "rules disable", "save", "status", "compat", "test", "report", "diag", "diag parse-ports",
-                        "diag to-ports", "diag rules", "diag used-ports", "diag conflicts", "diag test", "diag set"):
+                        "diag to-ports", "diag rules", "diag used-ports", "diag conflicts", "diag test", "diag set",
+                        "service", "service set", "service plan", "service clear", "service list", "service detect"):
             code, out, err = tool(*command.split(), "--help")
             self.assertEqual((code, err), (OK, ""), command)
             self.assertIn(command, page)
@@ -441,6 +443,121 @@ class Tool(unittest.TestCase):
                 ("diag set hoplink;5000;tcp", OK, r"router_ports \[5000\]=not test\n")):
             self.expect(arguments, code, pattern)
         self.assertEqual(self.json("diag", "to-ports", "1,2")[1]["output"], "1-2\n")
+
+    # ---- relay services -------------------------------------------------------------------------
+
+    def store(self, *rules):
+        """rule.conf from (enabled, protocol, router ports, box ports, service)."""
+        put(RULES, "".join(f'[{i}]\nenabled="{on:d}"\nprotocol name="{protocol}"\nr_port="{router}"\ns_port="{box}"\n'
+                           f'service="{name}"\n' for i, (on, protocol, router, box, name) in enumerate(rules, 7)))
+
+    def test_who_keeps_a_port(self):
+        """Each case: rules of ours, the request, what stays out and why, or why all of it fails."""
+        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="3"\n')
+        no_port = {}
+        for rules, request, out, after, fails in (
+                ((), "80/tcp 90-91/udp", no_port, ["80", "90-91"], None),
+                (((1, "tcp", "80", "80", "web"),), "80-81/tcp", {"80/tcp": r"rule 7 \(web\) has it"}, ["80", "81"], None),
+                (((1, "all", "80", "80", ""),), "80/tcp", {"80/tcp": "rule 7 has it"}, ["80"], None),
+                (((1, "tcp", "80", "80", ""),), "80/all", no_port, ["80", "80"], None),
+                (((1, "tcp", "8080", "80", ""),), "80/tcp", None, None, "half of what rule 7 forwards"),
+                (((0, "tcp", "80,443", "80,443", "hoplink"),), "443/tcp 8080/tcp",
+                 {"443/tcp": "rule 7 .* switches it off"}, ["443", "8080"], None),
+                (((0, "tcp", "80", "80", "hoplink"),), "81/tcp", no_port, ["81"], None),
+                (((0, "tcp", "80", "81", "hoplink"),), "81/tcp", None, None, "names one of the two"),
+                (((1, "tcp", "80", "80", "hoplink"),), "81/tcp", no_port, ["81"], None),
+                (((1, "tcp", "80,81", "80", "x"),), "82/tcp", no_port, ["80-81", "82"], None),
+                ((), "5000/tcp 5000/udp 5000/all", {"5000/tcp": "another host", "5000/all": "another host"}, ["5000"], None),
+                (((0, "tcp", "5000", "5000", "hoplink"),), "5000/tcp", {"5000/tcp": "switches it off"}, [], None),
+                ((), "1/tcp 3/tcp 5/tcp 7/tcp", None, None, "holds 3 rules and there would be 4"),
+                (((1, "tcp", "x", "80", ""),), "82/tcp", None, None, "rule 7 cannot be read")):
+            self.store(*rules)
+            code, told = self.json("service", "plan", "hoplink", *request.split(), LD_PRELOAD=STAND_IN,
+                                   TAVO_USED="TCP:5000 UDP:53")
+            self.assertEqual(code, FAILED if fails else OK, told)
+            if fails:
+                self.assertRegex(told["refusal"], fails)
+                continue
+            stay = {f"{port['ports']}/{port['protocol']}": port["why_not"] for port in told["requests"] if not port["opens"]}
+            self.assertEqual(stay.keys(), out.keys(), (rules, request))
+            for port, why in out.items():
+                self.assertRegex(stay[port], why)
+            self.assertEqual([rule["router_ports"] for rule in told["rules_after"]], after, (rules, request))
+
+    def test_the_plan_is_what_the_library_does(self):
+        dice = random.Random(7)
+        span = lambda: dice.choice(["{0}", "{0}-{1}", "{0},{2}"]).format(*sorted(dice.sample(range(20, 29), 3)))
+        protocol = lambda: dice.choice(["tcp", "tcp", "udp", "all"])
+        outcomes = {}
+        for turn in range(120):
+            put(ROUTER, KNOWN.replace("Acme", "Zeta") % (("yes", "no") if turn % 2 else ("no", "yes")))
+            put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="0"\n')
+            rules = []
+            for _ in range(dice.randrange(4)):
+                ports = span()
+                rules.append((dice.randrange(2), protocol(), ports, ports if dice.random() < 0.6 else span(),
+                              dice.choice(["hoplink", "web", ""])))
+            self.store(*rules)
+            request = [f"{span()}/{protocol()}" for _ in range(dice.randrange(1, 3))]
+            world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:22 UDP:23 TCP:25", "TAVO_SAVE": "0 write"}
+            before = self.rows()
+            plan = self.json("service", "plan", "hoplink", *request, **world)[1]
+            self.assertEqual(self.rows(), before)
+            code, told = self.json("service", "set", "hoplink", *request, "--force", **world)
+            case = (rules, request, plan, told)
+            if plan["refusal"]:
+                self.assertEqual((code, told["result"], self.rows()), (FAILED, -1, before), case)
+            else:
+                out = any(not port["opens"] for port in plan["requests"])
+                self.assertEqual((code, told["result"]), (REFUSED if out else OK, 0), case)
+                self.assertEqual(self.json("rules", "list")[1]["rules"], plan["rules_after"], case)
+            outcomes[code] = outcomes.get(code, 0) + 1
+        self.assertGreater(min(outcomes[OK], outcomes[REFUSED], outcomes[FAILED]), 10, outcomes)
+
+    def test_answers_to_a_service(self):
+        world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:9", "TAVO_SAVE": "0 write", "TAVO_REACH": "2 0 NOLISTEN"}
+        for arguments, pattern in (("set hoplink 80", "'80' is no request: .*5000-5001/tcp"),
+                                   ("set hoplink 80/tpc", "did you mean 'tcp'"), ("plan hoplink 0/tcp", "no request"),
+                                   ("set hoplink", "ports is required"), ("clear", "service is required")):
+            self.expect(f"service {arguments}", USAGE, pattern)
+        self.expect("service set hoplink 80/tcp", FAILED, "not been detected yet: .*service detect", **world)
+        self.expect("service plan hoplink 80/tcp", FAILED, "would fail: the router has not been detected", **world)
+        put(ROUTER, KNOWN % ("no", "no"))
+        self.expect("service set hoplink 80/tcp", FAILED, "nothing was changed: .*own pages", **world)
+        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        self.expect("service set hoplink 80/tcp", FAILED, "nobody has recorded how many rules", **world)
+        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="9"\n')
+        self.expect("service list", OK, "no rule belongs to a service")
+        self.store((1, "tcp", "443", "8443", "web"))
+        self.expect("service set hoplink 80/tcp 81/udp --test", FAILED,
+                    "80/tcp +ok(?s:.)*81/udp +not tested +no program(?s:.)*could not be judged", **world)
+        self.expect("service set hoplink 80/tcp 9/tcp", REFUSED, "9/tcp +stays out: another host(?s:.)*stay out", **world)
+        self.expect("service list", OK, "hoplink +2 +enabled +tcp +80\n(?s:.)*web +1 ")
+        self.assertEqual(self.json("service", "list")[1]["rules"][0]["service_id"], "HopLink")
+        self.expect("service clear web", USAGE, "no service made it", **world)
+        self.expect("service clear hoplink", OK, "keeps no port for this service", **world)
+        self.assertEqual([row[1:] for row in self.rows()], [(True, "tcp", "443", "8443", "web")])
+        self.expect("service set hoplink " + ",".join(map(str, range(30001, 30341, 2))) + "/tcp", USAGE, "lose its end", **world)
+        self.expect("service set hoplink 80/tcp", FAILED, "stored, but the router did not take them all",
+                    **{**world, "TAVO_SAVE": "-1 write"})
+        self.expect("service set hoplink 81/tcp", FAILED, "service plan.* shows", **{**world, "TAVO_SAVE": "-1"})
+        with open("/tmp/routerconf.lock", "w", encoding="utf-8") as lock:
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            for arguments in ("set hoplink 80/tcp", "clear hoplink", "detect", "plan hoplink 80/tcp"):
+                self.expect(f"service {arguments}", BUSY, "another port-forwarding operation", **world)
+
+    def test_a_service_has_the_router_classified(self):
+        for detected, tested, code, pattern in (
+                ("0 0 0 1 1 0 32 10 80", "", OK, "by UPnP or NAT-PMP"), ("0 0 0 1 1 0 32 10 child", "", OK, "by UPnP"),
+                ("0 0 0 1 0 0 -1 10 80", "", OK, "its own pages"), ("-1 0 0 0 0 0 -1 10", "", FAILED, "'tavoportmap detect' says"),
+                ("0 0 0 1 2 0 -1 10 80", "0 0 Zeta yes 20 10 90", OK, "by UPnP"),
+                ("0 0 0 1 2 0 -1 10 80", "1 0 Zeta no -1 10 30", OK, "its own pages")):
+            self.setUp()
+            world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": detected, "TAVO_COMPAT": tested}
+            got, out, err = tool("service", "detect", **world)
+            self.assertEqual((got, len(re.findall(pattern, out + err))), (code, 1), (detected, tested, out, err))
+            self.assertEqual(os.path.exists(f"{CONF}/router_upnp.db.user"), bool(tested))
 
     def test_models(self):
         os.makedirs(MODELS)

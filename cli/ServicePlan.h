@@ -1,0 +1,49 @@
+// What a service's request would come to: which of its ports open, which do not and why, and what becomes of
+// the stored rules. Relies on nothing but what is handed in. Promises: the outcome is that of the library's own
+// merge, rule by rule and port by port; nothing is changed.
+#pragma once
+
+#include <optional>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "RuleStore.h"
+
+namespace tavo::cli {
+
+using Requests = std::vector<__tag_TAVO_PORTMAP_RULE>;
+
+// What other hosts hold on the router.
+struct UsedPorts {
+    std::set<int> setTcp;
+    std::set<int> setUdp;
+};
+
+struct PortFate {
+    std::string szPorts;
+    std::string szProtocol;
+    std::string szWhyNot;  // empty: they open
+};
+
+struct RuleFate {
+    std::string szRule;  // id and name
+    std::string szWhat;
+};
+
+struct ServicePlan {
+    std::string szRefusal = {};  // why the request would fail as a whole; the rest is empty then
+    std::vector<PortFate> rgPorts = {};
+    std::vector<RuleFate> rgRules = {};
+    Rules after = {};    // rule.conf, as it would be
+    bool blCut = false;  // a list of ports there is longer than a rule holds, and loses its end
+};
+
+// rgStored: as the library's own reader gives them. used: nothing where the router is not asked.
+ServicePlan MakePlan(const std::string& szService, const Requests& rgRequests,
+                     const std::vector<__tag_TAVO_ROUTER_RULE>& rgStored, const std::optional<UsedPorts>& used);
+
+// The protocol words of requests, in the order of their numbers.
+extern const std::vector<std::string> kProtocolWords;
+
+}  // namespace tavo::cli
