@@ -305,7 +305,9 @@ TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUT
  * TLibSaveRules does. Takes the router lock itself. blTestConnection: then tests every port asked for, also
  * those that somebody else keeps, and writes each request's nTestConnStatus. 0; 1: the router has not been
  * detected; 2: the lock is held; -1: failed. rule.conf is as before unless the save came as far as writing
- * it; a test that fails leaves the new rules in place. */
+ * it; a test that fails leaves the new rules in place. Not refused: an enProtocol above 2 (stored without a
+ * protocol, so that later calls fail until rule.conf is mended), and a request whose ports make a text
+ * ("80-82, 90") that does not fit a rule: it is cut there, maybe inside a number, and logged. */
 TAVO_API int TLibTavoPortMapRulesSet(const char* szServiceName, __tag_TAVO_PORTMAP_RULE* rgRules, int nRules,
                                      bool blTestConnection);
 /* Has the router in front classified, once: later calls answer what is stored. Takes the router lock itself;

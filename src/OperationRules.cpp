@@ -112,11 +112,19 @@ bool IsFitForBuilding(OPERATION_RULE* const* pRgOutRules, const __tag_TAVO_ROUTE
     return true;
 }
 
-bool FillOutPorts(char (&szField)[TAVO_TEXT_SIZE], const PortList& ports) {
-    if (tavo::lib::ToPorts(szField, TAVO_TEXT_SIZE, ports) != 0) {
+// A cut text can end inside a number or a range and so name ports that the rule does not have: whoever looks
+// for them finds why. Room for one character more tells it from a text that just fits.
+bool FillOutPorts(char (&szField)[TAVO_TEXT_SIZE], const PortList& ports, int nId) {
+    char szText[TAVO_TEXT_SIZE + 1] = {};
+    if (tavo::lib::ToPorts(szText, sizeof(szText), ports) != 0) {
         LogError("%s:%d ToPorts() failed", kHopLinkFile, __LINE__);
         return false;
     }
+    if (szText[TAVO_TEXT_SIZE - 1] != '\0') {
+        LogError("%s:%d ports of rule %d do not fit, cut at %d characters", kHopLinkFile, __LINE__, nId,
+                 TAVO_TEXT_SIZE - 1);
+    }
+    tavo::lib::FillText(szField, szText);
     return true;
 }
 
@@ -128,14 +136,14 @@ bool FillRouterRule(__tag_TAVO_ROUTER_RULE& rule, const OPERATION_RULE& opRule, 
         LogError("%s:%d rgOpRules[i].routerPortSet is NULL", kHopLinkFile, __LINE__);
         return false;
     }
-    if (!FillOutPorts(rule.szRouterPort, *opRule.routerPortSet)) {
+    if (!FillOutPorts(rule.szRouterPort, *opRule.routerPortSet, nId)) {
         return false;
     }
     if (opRule.boxPortSet == nullptr) {
         LogError("%s:%d rgOpRules[i].boxPortSet is NULL", kHopLinkFile, __LINE__);
         return false;
     }
-    if (!FillOutPorts(rule.szSrcPort, *opRule.boxPortSet)) {
+    if (!FillOutPorts(rule.szSrcPort, *opRule.boxPortSet, nId)) {
         return false;
     }
     tavo::lib::FillText(rule.szServiceID, opRule.szServiceId);

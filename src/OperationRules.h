@@ -3,6 +3,7 @@
 // releases its block and every list in it on every path.
 #pragma once
 
+#include <cstring>
 #include <list>
 #include <optional>
 #include <utility>
@@ -37,13 +38,17 @@ void FreeOperationRulesArray(OPERATION_RULE* rgRules, int nRules);
 template <typename Record, void (*pfnFree)(Record*, int)>
 struct OwnedArray {
     OwnedArray() = default;
-    ~OwnedArray() { pfnFree(rgRules, nRules); }
+    ~OwnedArray() { Free(); }
     OwnedArray(const OwnedArray&) = delete;
     OwnedArray& operator=(const OwnedArray&) = delete;
 
     void MoveTo(Record** pRgOutRules, int* pnOutRules) {
         *pRgOutRules = std::exchange(rgRules, nullptr);
         *pnOutRules = std::exchange(nRules, 0);
+    }
+    void Free() {
+        pfnFree(std::exchange(rgRules, nullptr), nRules);
+        nRules = 0;
     }
 
     Record* rgRules = nullptr;
@@ -55,6 +60,11 @@ inline void FreeRouterRulesArray(__tag_TAVO_ROUTER_RULE* rgRules, int /*nRules*/
     TLibFreeRulesArr(rgRules);
 }
 using RouterRules = OwnedArray<__tag_TAVO_ROUTER_RULE, FreeRouterRulesArray>;
+
+// Whether the rule is the service's. A name that does not fit a rule is that of the rules made under it.
+inline bool IsOf(const OPERATION_RULE& rule, const char* szServiceName) {
+    return std::strncmp(rule.szServiceName, szServiceName, TAVO_TEXT_SIZE - 1) == 0;
+}
 
 // Walks the pairs of a rule whose lists are there and of one length, from the last to the first, and takes
 // out those that fnIsToGo(router port, box port) says; false, and no further, where it says nothing.

@@ -148,7 +148,7 @@ bool CheckArguments(const OPERATION_RULE* rgOpRules, int nOpRules, const OPERATI
 bool DeleteConflictPorts(OPERATION_RULE* rgOpRules, int nOpRules, const char* szServiceName, const UsedPorts& used,
                          const char* szArray) {
     for (int i = 0; i < nOpRules; ++i) {
-        if (szServiceName != nullptr && std::strcmp(rgOpRules[i].szServiceName, szServiceName) != 0) {
+        if (szServiceName != nullptr && !IsOf(rgOpRules[i], szServiceName)) {
             continue;
         }
         if (DeleteConflictPortsFromOpRule(rgOpRules[i], used) != 0) {

@@ -3,17 +3,12 @@
 #include "RuleConflicts.h"
 
 #include <algorithm>
-#include <cstring>
 
 namespace tavo::lib {
 
 namespace {
 
 enum class Selection { In, Out, Unclear };
-
-bool IsOf(const OPERATION_RULE& rule, const char* szServiceName) {
-    return std::strcmp(rule.szServiceName, szServiceName) == 0;
-}
 
 // The name decides first: a rule that it turns away never meets a filter that wants nothing.
 Selection Select(const OPERATION_RULE& rule, const RULE_FILTER* pFilter) {

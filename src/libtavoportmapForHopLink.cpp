@@ -114,11 +114,18 @@ bool CheckArguments(const char* szServiceName, const Request* rgRules, int nRule
     return true;
 }
 
+bool ReadInitState(InitState& enState) {
+    if (tavo::lib::GetInitState(&enState) != 0) {
+        LogError("%s:%d GetInitState() failed", kHopLinkFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
 // kRulesSet where the gateway takes rules from a service, else the answer to give.
 int CheckInitState() {
     InitState enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
-    if (tavo::lib::GetInitState(&enState) != 0) {
-        LogError("%s:%d GetInitState() failed", kHopLinkFile, __LINE__);
+    if (!ReadInitState(enState)) {
         return kFailed;
     }
     switch (enState) {
@@ -206,6 +213,8 @@ bool ServiceRules::Save() {
         LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
         return false;
     }
+    mStored.Free();  // of wide ranges these lists are large, and the test makes them once more
+    mRequested.Free();
     char szGateway[TAVO_TEXT_SIZE] = {};
     if (TLibGetGatewayIP(szGateway, sizeof(szGateway)) != 0) {
         LogError("%s:%d get gateway ip failed", kHopLinkFile, __LINE__);
@@ -379,8 +388,7 @@ int DetectRouter() {
         return kFailed;
     }
     InitState enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
-    if (tavo::lib::GetInitState(&enState) != 0) {
-        LogError("%s:%d GetInitState() failed", kHopLinkFile, __LINE__);
+    if (!ReadInitState(enState)) {
         return kFailed;
     }
     switch (enState) {

@@ -1,9 +1,11 @@
 // The relay service's part: port lists as text, operation rules, and who keeps a port in a merge.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <climits>
 #include <numeric>
 #include <random>
+#include <set>
 
 #include "naive_conflicts.h"
 #include "world.h"
@@ -226,6 +228,32 @@ TEST_F(Relay, MemoryThatRunsOutLeavesNoArray) {
     EXPECT_TRUE(Logged("new set<int> failed"));
 }
 
+TEST_F(Relay, WhatDoesNotFitARule) {
+    std::string szPorts = "10000";
+    for (int nPort = 10002; szPorts.size() + 6 < 1024; nPort += 2) {
+        szPorts += "," + std::to_string(nPort);
+    }
+    const std::string szName(1100, 'n');
+    for (const auto& [szText, nWritten, lines] :
+         {std::tuple(std::string("10000,10002-10003"), 18U, Lines{}),
+          std::tuple(szPorts, 1023U, Lines(2, "ports of rule 1 do not fit, cut at 1023 characters"))}) {
+        gLog.clear();
+        const __tag_TAVO_PORTMAP_RULE request = Request(szText.c_str(), 0);
+        OperationRules rules;
+        RouterRules back;
+        ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, szName.c_str(), &request, 1), 0);
+        ASSERT_EQ(CreateRulesArray(&back.rgRules, &back.nRules, rules.rgRules, 1, nullptr, 0), 0);
+        EXPECT_EQ(strlen(back.rgRules->szRouterPort), nWritten);
+        EXPECT_STREQ(back.rgRules->szSrcPort, back.rgRules->szRouterPort);
+        EXPECT_EQ(gLog, lines);
+        // Under the same long name the service still finds its rules.
+        EXPECT_EQ(DeletePortsFromRuleConf(rules.rgRules, 1, szName.substr(0, 1022).c_str()), 0);
+        EXPECT_FALSE(rules.rgRules->blDeleted);
+        EXPECT_EQ(DeletePortsFromRuleConf(rules.rgRules, 1, szName.c_str()), 0);
+        EXPECT_TRUE(rules.rgRules->blDeleted);
+    }
+}
+
 // ---- the merge --------------------------------------------------------------------------------------------
 
 // "D tcp hop 80,443>80,443; E all - 5>5": disabled or enabled, protocol, service, router>box ports.
@@ -378,6 +406,37 @@ TEST_F(Relay, RefusedArgumentsOfAPass) {
     EXPECT_TRUE(gLog.empty());
 }
 
+TEST_F(Relay, WhichRulesAFilterLeavesIn) {
+    const struct {
+        RULE_FILTER filter;
+        const char* szOut;  // of "E hop", "D hop", "E web", "D web": '1' out, '0' in, 'x' cannot be judged
+    } rgCases[] = {
+        {{nullptr, false, true, true}, "0000"}, {{nullptr, true, true, false}, "0101"},
+        {{nullptr, true, false, true}, "1010"}, {{nullptr, true, false, false}, "xxxx"},
+        {{"hop", true, true, true}, "0011"},    {{"hop", false, true, false}, "1101"},
+        {{"hop", true, false, true}, "1011"},   {{"hop", true, false, false}, "xx11"},
+        {{"hop", false, false, false}, "11xx"}, {{"Hop", true, true, true}, "1111"},
+    };
+    const Set rules("E tcp hop 1>1;D tcp hop 1>1;E tcp web 1>1;D tcp web 1>1");
+    for (const auto& c : rgCases) {
+        gLog.clear();
+        std::string szOut;
+        for (int i = 0; i < rules.nRules; ++i) {
+            bool blOut = false;
+            const int nResult = IsNeedToFilterOut(&blOut, rules.rgRules[i], &c.filter);
+            szOut += nResult == -1 ? 'x' : blOut ? '1' : '0';
+        }
+        EXPECT_EQ(szOut, c.szOut);
+        const auto nLines = static_cast<size_t>(std::count(szOut.begin(), szOut.end(), 'x'));
+        EXPECT_EQ(gLog, Lines(nLines,
+                              "Bad parameter, blMatchEnabledRules and blMatchDisabledRules shall not both be "
+                              "false"));
+    }
+    bool blOut = true;
+    EXPECT_EQ(IsNeedToFilterOut(&blOut, rules.rgRules[0], nullptr), 0);
+    EXPECT_FALSE(blOut);
+}
+
 // Rules of a few ports out of a few, so that everything overlaps; broken ones and odd protocols among them.
 class RandomRules {
 public:
@@ -399,8 +458,8 @@ public:
             rule.protocol = static_cast<PORTMAP_PROTOCOL>(OneIn(20) ? 7 : Below(3));
             FillText(rule.szServiceName, Name());
             const int nPorts = OneIn(30) ? 0 : 1 + Below(6);
-            rule.routerPortSet = OneIn(40) ? nullptr : Ports(nPorts);
-            rule.boxPortSet = OneIn(40) ? nullptr : Ports(OneIn(30) ? nPorts + 1 : nPorts);
+            rule.routerPortSet = OneIn(25) ? nullptr : Ports(nPorts);
+            rule.boxPortSet = OneIn(25) ? nullptr : Ports(OneIn(30) ? Below(8) : nPorts);
             if (blPairs && rule.boxPortSet != nullptr && rule.routerPortSet != nullptr) {
                 *rule.boxPortSet = *rule.routerPortSet;
             }
@@ -427,9 +486,25 @@ bool SameLists(const PortList* pOne, const PortList* pOther) {
     return pOne == nullptr || pOther == nullptr ? pOne == pOther : *pOne == *pOther;
 }
 
+// How a pass ended, without the numbers; and whether it took something away.
+std::string Outcome(const Lines& lines, size_t nBefore, size_t nAfter) {
+    std::string szOutcome = nAfter < nBefore ? "less" : "same";
+    for (const std::string& szLine : lines) {
+        szOutcome += "; " + szLine;
+    }
+    std::erase_if(szOutcome, [](char c) { return (c >= '0' && c <= '9') || c == '-'; });
+    return szOutcome;
+}
+
+size_t CountPorts(const OperationRules& rules) {
+    return std::accumulate(rules.rgRules, rules.rgRules + rules.nRules, size_t{0}, [](size_t n, const auto& rule) {
+        return n + (rule.routerPortSet == nullptr ? 0 : rule.routerPortSet->size());
+    });
+}
+
 TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
     std::map<std::string, int> seen;
-    for (unsigned nSeed = 1; nSeed <= 20000; ++nSeed) {
+    for (unsigned nSeed = 1; nSeed <= 40000; ++nSeed) {
         RandomRules random(nSeed);
         OperationRules rules1, rules1Copy, rules, rulesCopy;
         random.Fill(rules1, rules1Copy);
@@ -440,6 +515,7 @@ TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
         const RULE_FILTER* pFilter2 = random.OneIn(3) ? nullptr : &filter2;
         const bool blDeleteFound = random.OneIn(2);
         gLog.clear();
+        const size_t nBefore = CountPorts(rules1);
         const int nExpected = naive::DeletePortsFromRules1(rules1Copy.rgRules, rules1Copy.nRules, rulesCopy.rgRules,
                                                            rulesCopy.nRules, blDeleteFound, pFilter1, pFilter2);
         const Lines expected = gLog;
@@ -456,15 +532,31 @@ TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
             ASSERT_TRUE(SameLists(one.routerPortSet, other.routerPortSet)) << nSeed;
             ASSERT_TRUE(SameLists(one.boxPortSet, other.boxPortSet)) << nSeed;
         }
-        const std::string szLine = expected.empty() ? "success" : expected[0].substr(0, 24);
-        ++seen[szLine];
+        ++seen[Outcome(expected, nBefore, CountPorts(rules1))];
     }
-    // Every outcome has been met, often enough to mean something.
-    for (const auto& [szLine, nTimes] : seen) {
-        EXPECT_GT(nTimes, 10) << szLine;
+    // Every way to end has been met, often enough to mean something, before and after something was removed;
+    // a filter of the first array that wants nothing ends a pass before that.
+    const std::string szNothing =
+        "same; Bad parameter, blMatchEnabledRules and blMatchDisabledRules shall not both be false"
+        "; IsNeedToFilterOut() rules failed";
+    std::set<std::string> ways = {szNothing};
+    for (const std::string szBefore : {"same", "less"}) {
+        ways.insert(szBefore);
+        ways.insert(szBefore + szNothing.substr(4) + "; IsPortInOpRules() failed");
+        for (const char* szWay :
+             {"rgOpRules[].routerPortSet is NULL", "rgOpRules[].boxPortSet is NULL",
+              "rgOpRules[].routerPortSet is NULL; IsPortInOpRules() failed",
+              "rgOpRules[].boxPortSet is NULL; IsPortInOpRules() failed",
+              "begin, router port numbers= != box port numbers=", "router port list size == ",
+              "failed, port is partial matched", "Bad parameter, nRouterPortNumber=; IsPortInOpRules() failed",
+              "Bad parameter, nBoxPortNumber=; IsPortInOpRules() failed"}) {
+            ways.insert(szBefore + "; " + szWay);
+        }
     }
-    EXPECT_GT(seen["success"], 2000);
-    EXPECT_GE(seen.size(), 8U);
+    EXPECT_EQ(seen.size(), ways.size());
+    for (const std::string& szWay : ways) {
+        EXPECT_GT(seen[szWay], 4) << szWay;
+    }
 }
 
 }  // namespace
