@@ -22,6 +22,7 @@ for szConf in platform.conf portcheck.conf; do
     dpkg-query -W -f '${Conffiles}' libtavoportmap | grep -q "^ */etc/tavo/$szConf " || fail "$szConf is no conffile"
 done
 [ "$(stat -c %a /etc/tavo/portcheck.conf)" = 600 ] || fail "others can read the port checker's token"
+[ "$(stat -c %a /tmp/upnp_test.lock)" = 600 ] || fail "the lock files are not there"
 tavoportmap status | grep -q '^gateway' || fail "the installed tool does not run"
 tavoportmap rules add web --router-port 443 >/dev/null
 

@@ -25,6 +25,8 @@ struct Network {
     std::function<void()> fnInit;  // when a detection begins to look for UPnP
     int nUpnpPort = 0;             // the one last asked for
     std::optional<TAVO_UPNP_GATEWAY_MODEL> model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"};
+    bool blForkFails = false;
+    std::function<void()> fnChild = [] {};  // first thing that the detection's child does
     int nServiceRestart = 0;
     int nRouterDbUpdates = 0;
     std::function<void()> fnRouterDbUpdate = [] {};

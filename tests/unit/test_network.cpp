@@ -1,4 +1,5 @@
 // The stand-ins behind a scripted network; without one they pass on to the platform.
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 
@@ -47,6 +48,17 @@ int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL* pModel) {
     }
     *pModel = gPNetwork->model.value_or(TAVO_UPNP_GATEWAY_MODEL{});
     return gPNetwork->model ? 0 : -1;
+}
+pid_t TLIBCProcFork() {
+    if (gPNetwork != nullptr && gPNetwork->blForkFails) {
+        errno = EAGAIN;
+        return -1;
+    }
+    const pid_t pid = Real("TLIBCProcFork", &TLIBCProcFork)();
+    if (pid == 0 && gPNetwork != nullptr) {
+        gPNetwork->fnChild();
+    }
+    return pid;
 }
 int TLIBServiceRestart(const char* szName) {
     if (gPNetwork == nullptr) {

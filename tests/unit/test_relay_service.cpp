@@ -13,21 +13,6 @@
 
 namespace {
 
-// The detection's child finds no gateway.
-bool gBlLostChild = false;
-
-}  // namespace
-
-extern "C" pid_t TLIBCProcFork() {
-    const pid_t pid = Real("TLIBCProcFork", &TLIBCProcFork)();
-    if (pid == 0 && gBlLostChild) {
-        gSzGateway.clear();
-    }
-    return pid;
-}
-
-namespace {
-
 using Lines = std::vector<std::string>;
 using Request = __tag_TAVO_PORTMAP_RULE;
 using Requests = std::vector<Request>;
@@ -572,9 +557,8 @@ TEST_F(RelayService, TheDetectionsChildComesBackWithoutTheLock) {
         blLocked = !LockIsFree();
         return 1;
     };
-    gBlLostChild = true;
+    mNetwork.fnChild = [] { gSzGateway.clear(); };
     const int nResult = TLibTavoPortMapRouterDetect();
-    gBlLostChild = false;
     if (getpid() != pidSelf) {
         Write("/tmp/child_result", std::to_string(nResult) + gLog.back());
         _exit(0);
