@@ -56,10 +56,13 @@ bool StopTest() {
 }
 
 Reply Stopped(bool blEnded) {
-    return blEnded ? Reply{.szMessage = "the test is stopped; its mappings are taken away, and nothing was recorded"}
-                   : Failure(
-                         "the test was told to stop, but it still takes its mappings away from a slow router; "
-                         "'tavoportmap status' shows when it has ended");
+    return blEnded
+               ? Reply{.szMessage =
+                           "the test is stopped and nothing was recorded; its mappings are taken away, or will be by "
+                           "the next test where the router has gone silent"}
+               : Failure(
+                     "the test was told to stop, but it still takes its mappings away from a slow router; "
+                     "'tavoportmap status' shows when it has ended");
 }
 
 Reply AlreadyTesting() {

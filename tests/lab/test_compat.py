@@ -10,8 +10,10 @@ import test_reach
 from homelab import BOX, BUILD, LAN2, wait_for
 
 LAB = None
+USER_DB = "/etc/portforward/router_upnp.db.user"
 FILES = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule")
 RULES = "/var/lib/tavo/upnp_test.conf"
+TOOL = f"{BUILD}/cli/tavoportmap"
 
 
 def start(*arguments):
@@ -30,7 +32,7 @@ def test_daemon():
 class Compat(unittest.TestCase):
     def setUp(self):
         LAB.install()
-        LAB.clear_state(*FILES)
+        LAB.clear_state(*FILES, USER_DB)
 
     def tearDown(self):
         LAB.stop_daemon(signal.SIGKILL)
@@ -97,6 +99,31 @@ class Compat(unittest.TestCase):
         LAB.stop_router()
         LAB.start_scripted("keeps_nothing")
         self.assertEqual(run(10, "test"), {"result": 1, "status": 0, "support": "no", "max": -1})
+
+    def test_the_tool_learns_a_limit_and_saving_goes_by_it(self):
+        LAB.start_scripted("full_at_32")
+        LAB.write("/etc/portforward/router_upnp.db", "")
+        told = json.loads(LAB.run("box", f"{TOOL} --json compat --record").stdout)
+        self.assertEqual((told["passed"], told["max_rules"], told["recorded"]), (True, 32, True))
+        LAB.run("box", f"{TOOL} router set --brand {told['router']['brand']} --model Scripted --version 7")
+        LAB.write("/etc/portforward/rule.conf", "".join(
+            f'[{i}]\nenabled="1"\nprotocol name="tcp"\nr_port="{5000 + i}"\ns_port="5001"\n' for i in range(1, 34)))
+        refused = LAB.run("box", f"{TOOL} save", check=False)
+        self.assertEqual(refused.returncode, 5)
+        self.assertIn("the router holds 32 rules and there are 33", refused.stderr)
+
+    def test_the_tool_that_is_interrupted_leaves_nothing(self):
+        LAB.start_scripted("silent_adds_at_10")
+        tool = LAB.start("box", TOOL, "compat", "--yes", stderr=subprocess.PIPE, text=True)
+        wait_for(lambda: len(LAB.scripted()["table"]) == 10, 20, "some mappings are there")
+        refused = LAB.run("box", f"{TOOL} compat", check=False)
+        self.assertIn("running already", refused.stderr)
+        self.assertEqual(len(LAB.scripted()["table"]), 10)
+        tool.send_signal(signal.SIGINT)
+        self.assertIn("the test is stopped", tool.communicate(timeout=5)[1])
+        self.ended(0)
+        self.assertEqual(LAB.scripted()["table"], [])
+        self.assertFalse(os.path.exists(USER_DB))
 
     def test_a_second_start_ends_the_first(self):
         LAB.start_scripted("silent_adds_at_10")
