@@ -1,55 +1,109 @@
-"""The main job, shown: three saves against a real router, and a stranger who tries each port."""
+"""The main job, shown: a box learns what its router is, the user's rules and a relay service's request go
+into a real router, and a stranger outside tries each port. Everything is said by the tool itself."""
+import os
+import shlex
 import sys
 
 import homelab
-from homelab import BOX, LAN2
+import networks
+from homelab import BOX, BUILD, GATEWAY, LAN2, WAN, wait_for
 
-SAVES = (
-    ("first rules", ("1,1,tcp,5001,5001", "2,1,udp,6001,5002", "3,1,all,7001,5003")),
-    ("changed rules", ("1,1,tcp,5001,5002", "2,0,udp,6001,5002")),
-    ("no rules", ()),
-)
-PROBES = (("tcp", 5001), ("udp", 6001), ("tcp", 7001), ("udp", 7001))
-ROW = "  {:<10} {:<34} {:<24} {:<8} {}"
+TOOL = f"{BUILD}/cli/tavoportmap"
+CHECKD = f"{BUILD}/platform/linux/daemons/tavoportcheckd"
+TOKEN, CHECK_PORT = "0123456789abcdef-story", 8099
+FOREIGN = {("tcp", 5001): (LAN2, 5001), ("tcp", 9999): (LAN2, 9999)}
+PROBES = (("tcp", 8443), ("udp", 6001), ("tcp", 5000), ("tcp", 5001), ("udp", 6000))
+ROW = "  {:<10} {:<22} {:<24} {:<8} {}"
 
 
-def show(lab, rules):
-    wanted = {}
-    for rule in rules:
-        _, enabled, protocol, router_port, box_port = rule.split(",")
-        for single in ("tcp", "udp") if protocol == "all" else (protocol,):
-            if enabled == "1":
-                wanted[(single, int(router_port))] = (BOX, int(box_port))
-    wrong = 0
-    mappings = lab.mappings()
-    for probe in PROBES:
-        name = f"{probe[1]}/{probe[0]}"
-        asked = "box port %d" % wanted[probe][1] if probe in wanted else "nothing"
-        there = "%s:%d" % mappings[probe] if probe in mappings else "no mapping"
-        outcome = "open" if lab.reaches(*probe) else "closed"
-        right = mappings.get(probe) == wanted.get(probe) and (outcome == "open") == (probe in wanted)
-        wrong += not right
-        print(ROW.format(name, asked, there, outcome, "as asked" if right else "WRONG"))
-    foreign = mappings.get(("tcp", 9999))
-    print(ROW.format("9999/tcp", "another host's", "%s:%d" % foreign if foreign else "gone", "",
-                     "untouched" if foreign == (LAN2, 9999) else "WRONG"))
-    return wrong + (foreign != (LAN2, 9999))
+class Story:
+    def __init__(self, lab):
+        self.lab = lab
+        self.wrong = 0
+
+    def tool(self, command):
+        print(f"\n$ tavoportmap {command}", flush=True)
+        done = self.lab.run("box", f"{TOOL} {command}", check=False)
+        print("".join(f"  {line}\n" for line in done.stdout.splitlines()), end="")
+        if done.returncode:
+            print("".join(f"  {line}\n" for line in done.stderr.splitlines()), end="")
+        return done.returncode
+
+    def succeed(self, command):
+        if self.tool(command):
+            self.wrong += 1
+            print("  WRONG: this should have succeeded")
+
+    def show(self, **wanted):
+        """wanted: "tcp8443": box port. A port that nobody asked for must be closed, another host's untouched."""
+        asked = {(name[:3], int(name[3:])): (BOX, port) for name, port in wanted.items()}
+        everything = {**FOREIGN, **asked}
+        try:
+            wait_for(lambda: self.lab.mappings() == everything, 10, "the router follows")
+        except AssertionError:
+            pass  # the table says what is different
+        there = self.lab.mappings()
+        print("\n" + ROW.format("port", "asked for", "the router's mapping", "outside", ""))
+        for probe in PROBES:
+            mapping = there.get(probe)
+            outcome = "open" if self.lab.reaches(*probe) else "closed"
+            right = mapping == everything.get(probe) and (outcome == "open") == (probe in asked)
+            self.wrong += not right
+            verdict = "WRONG" if not right else "another host's, untouched" if probe in FOREIGN else "as asked"
+            print(ROW.format(f"{probe[1]}/{probe[0]}", f"box port {asked[probe][1]}" if probe in asked else "-",
+                             "%s:%d" % mapping if mapping else "-", outcome, verdict))
+        for surplus in set(there) - set(everything):
+            self.wrong += 1
+            print(ROW.format(f"{surplus[1]}/{surplus[0]}", "-", "%s:%d" % there[surplus], "", "WRONG"))
+
+
+def prepare(lab):
+    """A box that knows nothing of its router, a port checker outside, and another host's mappings."""
+    os.unlink("/etc/portforward/router.conf")
+    outside = networks.Outside(lab)
+    outside.settings()
+    with open("/etc/tavo/platform.conf", "a", encoding="ascii") as file:
+        file.write(f'[portcheck]\nurl="http://{WAN}:{CHECK_PORT}"\ntoken="{TOKEN}"\n')
+    lab.write("/etc/tavo/portcheck.conf", f'[portcheck]\ntoken="{TOKEN}"\nport="{CHECK_PORT}"\n')
+    os.chmod("/etc/tavo/portcheck.conf", 0o600)
+    lab.start("wan", CHECKD)
+    lab.serve(5000, 5002, 5003, 6000)
+    lab.start_router()
+    for _, port in FOREIGN:
+        lab.map_foreign(port)
 
 
 def main(lab):
-    lab.serve(5001, 5002, 5003)
-    lab.start_router()
-    lab.map_foreign(9999)
-    wrong = 0
-    for title, rules in SAVES:
-        answer = lab.save(*rules)
-        print(f"\nSaved: {title} (result {answer['result']}, progress {answer['progress']})")
-        print(ROW.format("port", "rule asks for", "the router's mapping", "outside", ""))
-        if not rules:  # nothing to read back, so the save does not wait for the router
-            homelab.wait_for(lambda: set(lab.mappings()) == {("tcp", 9999)}, 10, "the mappings are gone")
-        wrong += (answer["result"] != 0) + show(lab, rules)
-    print("\n" + ("All as asked." if not wrong else f"{wrong} differ."))
-    return 1 if wrong else 0
+    prepare(lab)
+    story = Story(lab)
+    print("What router is this, and does it do what it says? (a test of about a minute)")
+    story.succeed("service detect")
+    story.succeed("status")
+
+    print("\nThe user's rules")
+    story.succeed("rules add web --router-port 8443 --box-port 5002")
+    story.succeed("rules add game --protocol udp --router-port 6001 --box-port 5003")
+    story.succeed("save")
+    story.show(tcp8443=5002, udp6001=5003)
+
+    print("\nA relay service asks for ports, one of which another host holds")
+    request = shlex.quote("5000-5001/tcp") + " 6000/udp"
+    story.tool(f"service plan hoplink {request}")
+    story.succeed(f"service set hoplink {request} --test")
+    story.show(tcp8443=5002, udp6001=5003, tcp5000=5000, udp6000=6000)
+
+    print("\nThe service leaves; the user changes a rule")
+    story.succeed("service clear hoplink")
+    story.succeed("rules remove 2")
+    story.succeed("save")
+    story.show(tcp8443=5002)
+
+    print("\nNo rules")
+    story.succeed("rules remove 1")
+    story.succeed("save")
+    story.show()
+    print("\n" + ("All as asked." if not story.wrong else f"{story.wrong} differ."))
+    return 1 if story.wrong else 0
 
 
 if __name__ == "__main__":
