@@ -7,11 +7,13 @@ import time
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), "..", "tests", "lab"))
 import homelab
+import networks
 
 PORTS, FIRST, RUNS = 100, 20000, 5
 IGD = f"{homelab.BUILD}/platform/linux/daemons/tavo-igd"
 DESCRIPTION = f"-u http://{homelab.GATEWAY}:5000/rootDesc.xml"  # spares upnpc its discovery
 REDIRECTS = "-r " + " ".join(f"{FIRST + i} TCP" for i in range(PORTS))
+AIRPORT_WAIT = 6.0  # six polls, one second apart
 SERVICE = "urn:schemas-upnp-org:service:WANIPConnection:1"
 
 
@@ -73,6 +75,9 @@ def main(lab):
         print(f"{name:24} {mine:>8.3f} s {other:>8.3f} s {other / mine:>7.1f}x")
     print(f"{'bare adds, one by one':24} {router:>8.3f} s   nothing but AddPortMapping: the router's own time")
     print(f"{'again / listing':24} {again / listing:>10.2f}")
+    networks.Outside(lab)
+    detection = median(lab, f"{homelab.BUILD}/tests/lab/detector", 3)
+    print(f"{'a whole detection':24} {detection:>8.3f} s {AIRPORT_WAIT:>8.3f} s   of it the wait for base stations")
     return 0
 
 

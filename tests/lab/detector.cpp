@@ -4,7 +4,6 @@
 #include <json/json.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <vector>
@@ -79,7 +78,6 @@ int main(int argc, char** argv) {
     Notes notes{{}, argc > 1 ? argv[1] : nullptr};
     __tag_TAVO_ROUTER_DETECT_RESULT result = {};
     const pid_t pidSelf = getpid();
-    const auto start = std::chrono::steady_clock::now();
     const int nResult = blLast ? TLibGetRouterDetectResult(&result) : TLibDetectRouter(&result, &Note, &notes, true);
     if (getpid() != pidSelf) {
         _exit(1);
@@ -103,6 +101,5 @@ int main(int argc, char** argv) {
     jsAnswer["version"] = result.szVersion;
     jsAnswer["name"] = result.szUserSettingName;
     jsAnswer["max"] = result.nMaxRule;
-    jsAnswer["seconds"] = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
     return Print(jsAnswer);
 }
