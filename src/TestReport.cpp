@@ -1,7 +1,9 @@
 // What a compatibility test leaves behind: the user's own entry in the database, and the report of a failure.
 // Relies on the database's writer, the last detection, the settings of the router, tar and curl.
-// Promises: the user's settings are back in their place whatever happens; no text from the router leaves /tmp
-// or reaches a shell as anything but a name.
+// Promises: the user's settings are back in their place whatever happens, also where a signal ends the caller; no
+// text from the router leaves /tmp or reaches a shell as anything but a name.
+#include <signal.h>
+
 #include <ctime>
 #include <string_view>
 
@@ -18,11 +20,11 @@ using tavo::lib::kRouterConf;
 using tavo::lib::kRouterLog;
 using tavo::lib::kTestProgress;
 using tavo::lib::kUpnpStatus;
+using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
 using RouterConf = __tag_TAVO_ROUTER_CONF;
 using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
 
-constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
 constexpr char kReportUser[] = "tavoreportuser";
 constexpr char kReportPassword[] = "rtrsubmit417";
 
@@ -35,6 +37,26 @@ std::string ArchiveBrand(const char* szBrand) {
     }
     return szName.find_first_not_of('.') == std::string::npos ? "" : szName;
 }
+
+// Holds back the signals that would end this thread's process with the settings aside; they come when the object
+// goes. The commands run meanwhile have them, so that Ctrl-C still ends an upload.
+class SignalsHeld {
+public:
+    SignalsHeld() {
+        sigset_t held;
+        sigemptyset(&held);
+        for (const int nSignal : {SIGHUP, SIGINT, SIGQUIT, SIGTERM}) {
+            sigaddset(&held, nSignal);
+        }
+        pthread_sigmask(SIG_BLOCK, &held, &mBefore);
+    }
+    ~SignalsHeld() { pthread_sigmask(SIG_SETMASK, &mBefore, nullptr); }
+    SignalsHeld(const SignalsHeld&) = delete;
+    SignalsHeld& operator=(const SignalsHeld&) = delete;
+
+private:
+    sigset_t mBefore;
+};
 
 // The router settings, moved aside for as long as the object lives.
 class SettingsAside {
@@ -57,6 +79,7 @@ public:
     }
 
 private:
+    SignalsHeld mHeld;
     std::string mSzAside;
 };
 
@@ -99,13 +122,15 @@ bool PackReport(const std::string& szArchive) {
     return true;
 }
 
+// A server's name that is too long for the command is refused: a cut command is another command.
 bool SendReport(const std::string& szArchive) {
+    const char* szServer = GetUPnPReportServer();
+    const std::string szQuoted = tavo::lib::InQuotes(szServer == nullptr ? "" : szServer);
     char szCommand[tavo::lib::kCommandSize] = {};
-    std::snprintf(szCommand, sizeof(szCommand),
-                  "%s --digest -u '%s:%s' -F 'uploadedfile=@%s;filename=%s' '%s' >/dev/null 2>&1", "/usr/tavo/bin/curl",
-                  kReportUser, kReportPassword, szArchive.c_str(), szArchive.c_str(),
-                  tavo::lib::InQuotes(GetUPnPReportServer()).c_str());
-    if (TLIBCSystem(szCommand) != 0) {
+    const int nLength = std::snprintf(
+        szCommand, sizeof(szCommand), "%s --digest -u '%s:%s' -F 'uploadedfile=@%s;filename=%s' '%s' >/dev/null 2>&1",
+        "/usr/tavo/bin/curl", kReportUser, kReportPassword, szArchive.c_str(), szArchive.c_str(), szQuoted.c_str());
+    if (nLength < 0 || static_cast<size_t>(nLength) >= sizeof(szCommand) || TLIBCSystem(szCommand) != 0) {
         LogError("%s:%d update upnp router info failed", kEntryFile, __LINE__);
         return false;
     }
@@ -141,7 +166,7 @@ int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record) {
             return -1;
         }
         if (!writer.Sync()) {
-            LogError("%s:%d fail add section into [%s][0x%04X %s:%d]", kEntryFile, __LINE__, kUserDb,
+            LogError("%s:%d fail add section into [%s][0x%04X %s:%d]", kEntryFile, __LINE__, kUpnpUserDb,
                      static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
             return -1;
         }

@@ -18,6 +18,9 @@ for szUnit in $(dpkg -L libtavoportmap | sed -n 's|^/usr/lib/systemd/system/||p'
     [ -x "$szProgram" ] || fail "$szUnit starts $szProgram, which is not there"
     ldd "$szProgram" | grep -q 'not found' && fail "$szProgram lacks a library"
 done
+for szTool in curl wget; do
+    "/usr/tavo/bin/$szTool" --version >/dev/null || fail "the library's $szTool does not run"
+done
 for szConf in platform.conf portcheck.conf; do
     dpkg-query -W -f '${Conffiles}' libtavoportmap | grep -q "^ */etc/tavo/$szConf " || fail "$szConf is no conffile"
 done

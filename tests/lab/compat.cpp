@@ -2,6 +2,8 @@
 // Usage: compat steps N   by the platform's calls, in the library's order but without its pauses
 //        compat test N    by the library
 //        compat stop      ends a test of another process, by the library
+//        compat known     looks who the router is, and keeps that its UPnP works
+//        compat report    sends the files of a test
 #include <unistd.h>
 
 #include <cstdio>
@@ -18,6 +20,7 @@ namespace {
 
 constexpr char kProgress[] = "/tmp/upnp_test.progress";
 constexpr useconds_t kPollMicroseconds = 20000;
+constexpr int kUsualRules = 60;
 
 bool IsDone(const char* szStep) {
     char szWord[32] = "processing";
@@ -69,6 +72,21 @@ int RunSteps(int nRules) {
     return *szFailed == '\0' ? 0 : 1;
 }
 
+int KnowRouter() {
+    UpnpDetector detector;
+    if (!detector.Start()) {
+        return 1;
+    }
+    __tag_TAVO_ROUTER_RECORD record = {};
+    std::snprintf(record.szBrand, sizeof(record.szBrand), "%s", detector.GetBrand().c_str());
+    std::snprintf(record.szModel, sizeof(record.szModel), "%s", detector.GetModel().c_str());
+    std::snprintf(record.szVersion, sizeof(record.szVersion), "%s", detector.GetVersion().c_str());
+    std::snprintf(record.szSupport, sizeof(record.szSupport), "yes");
+    record.nMaxRule = kUsualRules;
+    const bool blKept = TLibWriteRecordIntoUpnpDB(&record) == 0 && detector.Start();
+    return blKept && detector.GetSupportUpnp() == "yes" ? 0 : 1;
+}
+
 int RunTest(int nRules) {
     __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT result = {};
     const int nResult = TLibTestUpnpCompatibility(nRules, &result, nullptr, nullptr, true);
@@ -84,6 +102,12 @@ int main(int argc, char** argv) {
     const int nRules = argc > 2 ? std::atoi(argv[2]) : 0;
     if (szVerb == "stop") {
         return TLibStopTestUpnpCompatibility();
+    }
+    if (szVerb == "known") {
+        return KnowRouter();
+    }
+    if (szVerb == "report") {
+        return TLibUploadTestUpnpCompatibilityFailResult() == 0 ? 0 : 1;
     }
     return szVerb == "test" ? RunTest(nRules) : RunSteps(nRules);
 }

@@ -13,6 +13,7 @@
 
 #include "tavo/net.h"
 #include "tavo/upnp.h"
+#include "world.h"
 
 // What the network answers while a test has one; without one the real platform answers.
 struct Network {
@@ -44,7 +45,8 @@ struct Home {
 };
 extern Home* gPHome;
 
-// The answers of the test client; a step's word is what stands in the progress file once it is asked for.
+// The answers of the test client; a step's word is what stands in the progress file once it is asked for, and
+// for the count what stands there once it is reported.
 struct TestClient {
     int nWanted = 10;  // mappings that the caller is to ask for
     std::map<std::string, int> mapAnswers;
@@ -55,6 +57,7 @@ struct TestClient {
     std::vector<std::string> rgszRouterLog;
 
     int Call(const std::string& szCall, int nDefault) {
+        const OwnMemory own;
         rgszCalls.push_back(szCall);
         const auto it = mapAnswers.find(szCall);
         return it == mapAnswers.end() ? nDefault : it->second;

@@ -165,10 +165,11 @@ void WriteMarker(const std::vector<TestRule>& rgKept, bool blAdded, bool blGood)
 
 int TestPorts(bool blAdded) {
     const std::vector<TestRule> rgKept = KeptRules();
+    const int nMarked = TavoPortConnTestInit();  // first, for the report of a failure
     if (rgKept.empty() || !tavo::IsTestDaemonAlive()) {
         return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
     }
-    if (TLIBCFileExist(tavo::kPortTestMarker) == 0 && TavoPortConnTestInit() < 0) {
+    if (nMarked < 0) {
         return -1;
     }
     const std::vector<int> rgVerdicts = AskOutside(rgKept);
@@ -205,14 +206,15 @@ std::vector<TestRule> NewRules(int nRules) {
 
 int TAVOUPnPAddTest(int nRules) {
     return AtBorder(-1, [&] {
+        // A report of a test that ends early, wherever that is, is made of the same files as any other.
+        TLIBCFileTouch(tavo::kUpnpResults);
+        TavoPortConnTestInit();
         if (nRules < 1 || tavo::IsTestDaemonAlive()) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
         if (!tavo::SaveTestRules(NewRules(nRules))) {
             return -1;
         }
-        // A report of a test that ends early is made of the same files as any other.
-        TavoPortConnTestInit();
         return TLIBCExec(kTestProgram, "--debug", "-p", nullptr, nullptr);
     });
 }
@@ -232,11 +234,12 @@ int TAVOUPnPDeletetest() {
 int TAVOUPnPSetupTest(int nLimitSeconds, int nFlags) {
     return OrEnd(
         [&] {
+            const int nMarked = TavoPortConnTestInit();  // first, as above
             if (nLimitSeconds < 1 || nFlags != 0 || !tavo::IsTestDaemonAlive()) {
                 return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
             }
             gNLimitSeconds = std::min(nLimitSeconds, kMostLimitSeconds);
-            return TavoPortConnTestInit() < 0 ? -1 : 0;
+            return nMarked < 0 ? -1 : 0;
         },
         0);
 }

@@ -19,6 +19,7 @@ inline constexpr char kTestDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";  // its
 inline constexpr char kTestSocket[] = "/var/run/upnpd_test.sock";
 inline constexpr char kTestProgress[] = "/tmp/upnp_test.progress";
 inline constexpr char kPortTestMarker[] = "/tmp/pfStatusRule";
+inline constexpr char kUpnpResults[] = "/var/tmp/upnp_portmap.status";  // as of the daemon of the rules
 
 inline constexpr char kOrderDelete[] = "delete";
 inline constexpr char kOrderModify[] = "modify";

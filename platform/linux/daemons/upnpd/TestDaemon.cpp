@@ -36,7 +36,6 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 constexpr char kLockFile[] = "/var/run/upnpd_test.lock";
-constexpr char kResultFile[] = "/var/tmp/upnp_portmap.status";
 constexpr mode_t kResultMode = 0644;
 constexpr char kRunKey[] = "runupnpportmapping";
 constexpr int kDiscoveryMilliseconds = 8000;
@@ -99,7 +98,7 @@ bool TestDaemon::FindRouter() {
     if (mPIgd == nullptr) {
         if (!IsSignalled()) {
             Log("no router with UPnP port mapping was found");
-            WriteFileAtomic(kResultFile, "upnp=noigd\n", kResultMode);
+            WriteFileAtomic(kUpnpResults, "upnp=noigd\n", kResultMode);
         }
         return false;
     }
@@ -185,7 +184,7 @@ void TestDaemon::WriteResults() const {
     for (const TestRule& rule : mPMappings->Rules()) {
         szText += std::to_string(rule.nRouterPort) + "/tcp=" + rule.szResult + "\n";
     }
-    if (!SaveTestRules(mPMappings->Rules()) || !WriteFileAtomic(kResultFile, szText, kResultMode)) {
+    if (!SaveTestRules(mPMappings->Rules()) || !WriteFileAtomic(kUpnpResults, szText, kResultMode)) {
         syslog(LOG_ERR, "cannot write the results of the test");
     }
 }
