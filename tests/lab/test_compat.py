@@ -111,6 +111,9 @@ class Compat(unittest.TestCase):
         refused = LAB.run("box", f"{TOOL} save", check=False)
         self.assertEqual(refused.returncode, 5)
         self.assertIn("the router holds 32 rules and there are 33", refused.stderr)
+        LAB.run("box", f"{TOOL} rules remove 33")
+        LAB.run("box", f"{TOOL} save")
+        self.assertEqual(len(LAB.scripted()["table"]), 32)
 
     def test_the_tool_that_is_interrupted_leaves_nothing(self):
         LAB.start_scripted("silent_adds_at_10")
