@@ -40,6 +40,21 @@ enum SaveStatus : int {
     kStatusRangeLimit = 12
 };
 
+// What saving through one daemon says differently from saving through the other; the texts take the file
+// and the line.
+struct DaemonWay {
+    const char* szRunKey;
+    const char* szNotWritten;
+    const char* szNoRunKey;
+    const char* szTimeOut;
+    const char* szAlive;
+};
+
+constexpr DaemonWay kNatpmpWay{kNatpmpRunKey, "%s:%d sync rule to file fail", "%s:%d Failed to Set natpmp run key!",
+                               "%s:%d wait natpmp daemon alive time out", "%s:%d natpmp daemon is alive now"};
+constexpr DaemonWay kUpnpWay{kUpnpRunKey, "%s:%d can not sync rules to file", "%s:%d Failed to Set upnp run key!",
+                             "%s:%d wait upnp daemon alive time out", "%s:%d upnp daemon is alive now"};
+
 // One save, from validation to the router's answer. Each step answers whether to go on.
 class RuleSave {
 public:
@@ -67,10 +82,10 @@ private:
     bool CheckExceedMaxRule(bool& blExceed, int& nMaxRule);
     bool FitsRouter();
     bool WriteRules(const char* szFailure);
-    bool SaveNatpmp();
-    bool ReadBackNatpmp();
-    bool SaveUpnp();
-    bool ReadBackUpnp();
+    template <typename Daemon>
+    bool SaveThrough(Daemon daemon, const DaemonWay& way);
+    bool ReadBack(NatpmpDaemon& daemon);
+    bool ReadBack(UpnpDaemon& daemon);
     bool FitsManualRouter();
     void ReportManualExcess(RouterDB& db, int nMaxPort, int nPortJob, int nMaxRange, int nRangeJob);
     bool SaveManual();
@@ -230,35 +245,34 @@ bool WaitUntil(Done fnDone) {
     return false;
 }
 
-bool RuleSave::SaveNatpmp() {
-    if (!FitsRouter() || !WriteRules("%s:%d sync rule to file fail")) {
+template <typename Daemon>
+bool RuleSave::SaveThrough(Daemon daemon, const DaemonWay& way) {
+    if (!FitsRouter() || !WriteRules(way.szNotWritten)) {
         return false;
     }
-    if (!SetRunKey(kNatpmpRunKey, "yes")) {
-        LogError("%s:%d Failed to Set natpmp run key!", kEntryFile, __LINE__);
+    if (!SetRunKey(way.szRunKey, "yes")) {
+        LogError(way.szNoRunKey, kEntryFile, __LINE__);
         return false;
     }
-    NatpmpDaemon daemon;
     if (!daemon.Start()) {
-        LogError("%s:%d upnp daemon start failed", kEntryFile, __LINE__);
+        LogError("%s:%d upnp daemon start failed", kEntryFile, __LINE__);  // for either daemon
         return false;
     }
     if (!HasRules()) {
         return true;
     }
     if (!WaitUntil([&] { return daemon.IsAlive() && IsSavingRules() == 0; })) {
-        LogError("%s:%d wait natpmp daemon alive time out", kEntryFile, __LINE__);
+        LogError(way.szTimeOut, kEntryFile, __LINE__);
         return false;
     }
-    LogError("%s:%d natpmp daemon is alive now", kEntryFile, __LINE__);
+    LogError(way.szAlive, kEntryFile, __LINE__);
     Progress(90);
-    return ReadBackNatpmp();
+    return ReadBack(daemon);
 }
 
-bool RuleSave::ReadBackNatpmp() {
+bool RuleSave::ReadBack(NatpmpDaemon& daemon) {
     bool blRemap = false;
     std::string szRemap;
-    NatpmpDaemon daemon;
     if (!daemon.CheckDaemon(blRemap, szRemap)) {
         LogError("%s:%d check natpmp daemon failed", kEntryFile, __LINE__);
         return false;
@@ -272,37 +286,11 @@ bool RuleSave::ReadBackNatpmp() {
     return true;
 }
 
-bool RuleSave::SaveUpnp() {
-    if (!FitsRouter() || !WriteRules("%s:%d can not sync rules to file")) {
-        return false;
-    }
-    if (!SetRunKey(kUpnpRunKey, "yes")) {
-        LogError("%s:%d Failed to Set upnp run key!", kEntryFile, __LINE__);
-        return false;
-    }
-    UpnpDaemon daemon;
-    if (!daemon.Start()) {
-        LogError("%s:%d upnp daemon start failed", kEntryFile, __LINE__);
-        return false;
-    }
-    if (!HasRules()) {
-        return true;
-    }
-    if (!WaitUntil([&] { return daemon.IsAlive() && IsSavingRules() == 0; })) {
-        LogError("%s:%d wait upnp daemon alive time out", kEntryFile, __LINE__);
-        return false;
-    }
-    LogError("%s:%d upnp daemon is alive now", kEntryFile, __LINE__);
-    Progress(90);
-    return ReadBackUpnp();
-}
-
-bool RuleSave::ReadBackUpnp() {
+bool RuleSave::ReadBack(UpnpDaemon& daemon) {
     bool blConflict = false;
     bool blError = false;
     std::string szConflict;
     std::string szError;
-    UpnpDaemon daemon;
     if (!daemon.CheckDaemon(blConflict, blError, szConflict, szError)) {
         LogError("%s:%d check daemon failed", kEntryFile, __LINE__);
         return false;
@@ -420,7 +408,9 @@ bool RuleSave::Run(bool blLock, RouterLock& lock) {
         return false;
     }
     Progress(60);
-    const bool blSaved = szNatpmp == "yes" ? SaveNatpmp() : szUpnp == "yes" ? SaveUpnp() : SaveManual();
+    const bool blSaved = szNatpmp == "yes" ? SaveThrough(NatpmpDaemon(), kNatpmpWay)
+                         : szUpnp == "yes" ? SaveThrough(UpnpDaemon(), kUpnpWay)
+                                           : SaveManual();
     if (blSaved) {
         Progress(100);
     }

@@ -2,7 +2,7 @@
 
 Usage: side_by_side.py FILE. 0 when every case has passed.
 """
-import importlib.util
+import importlib
 import os
 import subprocess
 import sys
@@ -21,9 +21,7 @@ def cases(tests):
 
 def main(path):
     sys.path.insert(0, HERE)
-    spec = importlib.util.spec_from_file_location("lab_file", path)
-    module = importlib.util.module_from_spec(spec)
-    spec.loader.exec_module(module)
+    module = importlib.import_module(os.path.splitext(os.path.basename(path))[0])
     running = {case: subprocess.Popen([f"{HERE}/../sandbox", sys.executable, path, case], stdin=subprocess.DEVNULL,
                                       stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True)
                for case in cases(unittest.defaultTestLoader.loadTestsFromModule(module))}
