@@ -144,15 +144,16 @@ bool CheckArguments(const OPERATION_RULE* rgOpRules, int nOpRules, const OPERATI
     return true;
 }
 
-// The service's rules of one array (all of them for a null name), the deleted ones too.
+// The service's rules of one array (all of them for a null name), the deleted ones too. szFailure takes the
+// file, the line and the index.
 bool DeleteConflictPorts(OPERATION_RULE* rgOpRules, int nOpRules, const char* szServiceName, const UsedPorts& used,
-                         const char* szArray) {
+                         const char* szFailure) {
     for (int i = 0; i < nOpRules; ++i) {
         if (szServiceName != nullptr && !IsOf(rgOpRules[i], szServiceName)) {
             continue;
         }
         if (DeleteConflictPortsFromOpRule(rgOpRules[i], used) != 0) {
-            LogError("%s:%d DeleteConflictPortsForUPnPRouter(%s[%d]) failed", kHopLinkFile, __LINE__, szArray, i);
+            LogError(szFailure, kHopLinkFile, __LINE__, i);
             return false;
         }
     }
@@ -213,8 +214,10 @@ int DeleteConflictPortsForUPnPRouter(OPERATION_RULE* rgOpRules, int nOpRules, OP
         return -1;
     }
     const UsedPorts used{PortSet(tcpPorts.begin(), tcpPorts.end()), PortSet(udpPorts.begin(), udpPorts.end())};
-    return DeleteConflictPorts(rgOpRules, nOpRules, szServiceName, used, "rgOpRules") &&
-                   DeleteConflictPorts(rgOpConfRules, nOpConfRules, szServiceName, used, "rgOpConfRules")
+    return DeleteConflictPorts(rgOpRules, nOpRules, szServiceName, used,
+                               "%s:%d DeleteConflictPortsForUPnPRouter(rgOpRules[%d]) failed") &&
+                   DeleteConflictPorts(rgOpConfRules, nOpConfRules, szServiceName, used,
+                                       "%s:%d DeleteConflictPortsForUPnPRouter(rgOpConfRules[%d]) failed")
                ? 0
                : -1;
 }

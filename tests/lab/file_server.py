@@ -1,5 +1,5 @@
 """A download server with faults. Usage: file_server.py DIRECTORY PORT. The first part of a path chooses how
-the rest of it is served: good, half (dies in the middle), endless, stalls, missing."""
+the rest of it is served: good, half (dies in the middle), endless, stalls, missing, portal (a web page)."""
 import http.server
 import os
 import sys
@@ -17,6 +17,8 @@ class Handler(http.server.BaseHTTPRequestHandler):
             return self.send_error(404)
         with open(path, "rb") as file:
             data = file.read()
+        if fault == "portal":
+            data = b"\n <!DOCTYPE html><html>Please log in</html>"
         self.send_response(200)
         if fault != "endless":
             self.send_header("Content-Length", str(len(data)))

@@ -88,7 +88,7 @@ class Downloads(unittest.TestCase):
 
     def test_a_server_with_faults(self):
         both = (update_models, update_upnp)
-        for fault, calls, seconds in (("half", both, 10), ("missing", both, 10), ("endless", both, 60),
+        for fault, calls, seconds in (("half", both, 10), ("missing", both, 10), ("portal", both, 10), ("endless", both, 60),
                                       ("stalls", both[1:], 60)):
             with self.subTest(fault=fault):
                 self.serve_from(fault)
