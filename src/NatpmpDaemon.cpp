@@ -20,10 +20,7 @@ using tavo::lib::LogError;
 
 constexpr tavo::lib::DaemonControl kControl{kFile, tavo::lib::kNatpmpd, tavo::lib::kUpnpd, "/var/run/natpmpd.pid"};
 
-struct MallocDeleter {
-    void operator()(char* pBlock) const { std::free(pBlock); }
-};
-using Buffer = std::unique_ptr<char, MallocDeleter>;
+using Buffer = std::unique_ptr<char, tavo::lib::FreeDeleter>;
 
 // The platform may move the block while it grows it.
 int AskRemap(Buffer& szRemap, int& nSize) {

@@ -44,10 +44,6 @@ int RuleStatusOf(int enStatus, int nIndex, const char* szRouterPort) {
     }
 }
 
-struct FreeDeleter {
-    void operator()(void* pBlock) const { std::free(pBlock); }
-};
-
 int TestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules) {
     RouterRuleConfWriter rules;
     for (int i = 0; i < nRules; ++i) {
@@ -65,7 +61,7 @@ int TestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules) {
         return -1;
     }
     const size_t nEntries = static_cast<size_t>(std::max(nRules, 1));
-    const std::unique_ptr<TAVO_PORT_STATUS, FreeDeleter> pEntries(
+    const std::unique_ptr<TAVO_PORT_STATUS, tavo::lib::FreeDeleter> pEntries(
         static_cast<TAVO_PORT_STATUS*>(std::calloc(nEntries, sizeof(TAVO_PORT_STATUS))));
     if (!pEntries) {
         LogError("%s:%d malloc failed", kEntryFile, __LINE__);

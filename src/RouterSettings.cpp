@@ -7,7 +7,6 @@
 #include <cstring>
 
 #include "common.h"
-#include "tavo/net.h"
 
 namespace {
 
@@ -34,15 +33,7 @@ bool IsGatewayArgument(const char* szGwRouterIP, const RouterConf* pConf) {
         LogError("%s:%d routerConf is NULL", kEntryFile, __LINE__);
         return false;
     }
-    if (szGwRouterIP == nullptr) {
-        LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
-        return false;
-    }
-    if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
-        LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
-        return false;
-    }
-    return true;
+    return tavo::lib::IsGatewayAddress(szGwRouterIP);
 }
 
 bool FillIdentity(RouterConfReader& reader, RouterConf& conf) {

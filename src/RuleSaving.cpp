@@ -9,7 +9,6 @@
 
 #include "common.h"
 #include "tavo/log.h"
-#include "tavo/net.h"
 
 namespace {
 
@@ -101,12 +100,7 @@ private:
 };
 
 bool RuleSave::IsValid() const {
-    if (mSzGwRouterIP == nullptr) {
-        LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
-        return false;
-    }
-    if (BlTLIBIsIpAddr(mSzGwRouterIP) == 0) {
-        LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, mSzGwRouterIP);
+    if (!tavo::lib::IsGatewayAddress(mSzGwRouterIP)) {
         return false;
     }
     if (mPfnCallback != nullptr && mPResult == nullptr) {

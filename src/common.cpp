@@ -239,6 +239,18 @@ void FileLock::LeaveToParent() {
     mFd = -1;
 }
 
+bool IsGatewayAddress(const char* szGwRouterIP) {
+    if (szGwRouterIP == nullptr) {
+        LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
+        return false;
+    }
+    if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
+        LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
+        return false;
+    }
+    return true;
+}
+
 bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
     if (lock.Get()) {
         return true;

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdio>
+#include <cstdlib>
 #include <exception>
 #include <functional>
 #include <memory>
@@ -50,6 +51,10 @@ inline constexpr size_t kCommandSize = 4096;
 // One line of the system log at priority error. Every format begins "%s:%d ": the source path relative
 // to the tree, then the line. errno is kept, so "%m" works and callers may still look at it.
 void LogError(const char* szFormat, ...) __attribute__((format(printf, 1, 2)));
+
+struct FreeDeleter {
+    void operator()(void* pBlock) const { std::free(pBlock); }
+};
 
 struct ConfListDeleter {
     void operator()(TAVO_PF_CONF* pHead) const { TAVOPFConfFree(pHead); }
@@ -98,6 +103,9 @@ class RouterLock : public FileLock {
 public:
     RouterLock() : FileLock(kRouterLock) {}
 };
+
+// Whether a caller's gateway argument is an IP address; a refusal is logged.
+bool IsGatewayAddress(const char* szGwRouterIP);
 
 // The lock of an entry point that was asked to take it. False: held elsewhere, which is logged and, unless
 // pErr is null, told as a conflict.

@@ -8,7 +8,6 @@
 #include <cstring>
 
 #include "common.h"
-#include "tavo/net.h"
 
 namespace {
 
@@ -267,12 +266,7 @@ int TLibGetRouterDesc(const char* szGwRouterIP, __tag_TAVO_ROUTER_DESC* routerDe
             return -1;
         }
         routerDesc->blSupportChangePort = false;
-        if (szGwRouterIP == nullptr) {
-            LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
-            return -1;
-        }
-        if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
-            LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
+        if (!tavo::lib::IsGatewayAddress(szGwRouterIP)) {
             return -1;
         }
         RouterLock lock;
