@@ -353,9 +353,7 @@ TAVO_API int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TA
                            bool blLock);
 
 #ifdef __cplusplus
-} /* extern "C" */
-
-/* ---- relay service: ports ----------------------------------------------------------------------- */
+/* ---- relay service: ports, C linkage though not for C ------------------------------------------- */
 
 /* Appends the ports of a text ("80,443,8000-8010"; a range written backwards counts forwards) in their
  * order, duplicates kept. 0, or -1: null, no port at all, or one outside 1 to 65535; what stood before it
@@ -367,6 +365,7 @@ TAVO_API int TestFuncTLibParsePorts(std::list<int>& ports, char* szPort);
  * it searches for at most 30 seconds. 0 (also without mappings), or -1: no router, no gateway, or no
  * address of the box's on its subnet. */
 TAVO_API int TestFuncGetUsedRouterPortList(std::list<int>& tcpPorts, std::list<int>& udpPorts);
+} /* extern "C" */
 
 /* Opens (creating it) and locks szPath without waiting; fd receives the descriptor also when the lock
  * is held elsewhere: pass it to unlock_file in every case. 1: locked; 0: not. */
