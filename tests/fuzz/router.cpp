@@ -165,9 +165,9 @@ void Map(tavo::Igd& igd) {
     Watched router(igd);
     tavo::LeaseHabit habit;
     const tavo::PassResult result = tavo::Reconcile(router, rgWanted, kBox, habit, true, [] { return false; });
-    Require(result.rgStatus.size() >= rgWanted.size(), "every mapping has a status");
-    for (size_t i = 0; i < result.rgStatus.size(); ++i) {
-        const std::string& szStatus = result.rgStatus[i].second;
+    Require(result.rgOutcomes.size() >= rgWanted.size(), "every mapping has a status");
+    for (size_t i = 0; i < result.rgOutcomes.size(); ++i) {
+        const std::string& szStatus = result.rgOutcomes[i].verdict.szWord;
         Require(szStatus != "written" && !szStatus.empty(), "no status is left open");
         Require(szStatus != "1" || (i < rgWanted.size() && router.HasShown(rgWanted[i])),
                 "a mapping counts only when the router showed it");

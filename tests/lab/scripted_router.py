@@ -1,7 +1,8 @@
 """A router with faults: SSDP and SOAP on the LAN address, behaving as the named fault says.
 
 Usage: scripted_router.py FAULT [PORT [ADDRESS]]. GET /table gives its table and its counters as JSON; GET
-/hang?SECONDS has it answer no action for so long.
+/hang?SECONDS has it answer no action for so long, /outside?ADDRESS have another outside address, and
+/take?PORT[,HOST,TEXT] lose a TCP mapping, to another host where one is named.
 """
 import json
 import re
@@ -11,6 +12,7 @@ import sys
 import threading
 import time
 from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
+from urllib.parse import unquote
 
 FOREIGN = "192.168.77.3"
 FAULT = sys.argv[1]
@@ -43,6 +45,7 @@ STREAMS = {"endless_body": (b"HTTP/1.1 200 OK\r\n\r\n", b"<x>" * 10000, 0),
                         .encode(), b"", 1)}
 QUICK = [name for name in (*BODIES, *STREAMS) if name not in ("drip", "many_services")]
 HANG_UNTIL = 0
+OUTSIDE = "198.41.0.4"
 LOCATIONS = {"location_other_host": f"http://{FOREIGN}:5000/d.xml", "location_loopback": "http://127.0.0.1:5000/d.xml"}
 
 
@@ -93,6 +96,8 @@ def act(action, args):
         if FAULT == "conflict_secure" and key[1] == 5001:
             return fault(606)
         return answer(action, **entry(key)) if key in TABLE else fault(714)
+    if action == "GetExternalIPAddress":
+        return answer(action, NewExternalIPAddress=OUTSIDE)
     if action == "DeletePortMapping" and FAULT == "gives_nothing_back":
         return fault(606)
     if action == "DeletePortMapping" and FAULT == "deletes_nothing":
@@ -127,6 +132,16 @@ class Handler(BaseHTTPRequestHandler):
         elif self.path.startswith("/hang?"):
             global HANG_UNTIL
             HANG_UNTIL = time.monotonic() + float(self.path[6:])
+            self.say(299, "")
+        elif self.path.startswith("/outside?"):
+            global OUTSIDE
+            OUTSIDE = self.path[9:]
+            self.say(299, "")
+        elif self.path.startswith("/take?"):
+            port, *other = unquote(self.path[6:]).split(",")
+            TABLE.pop(("TCP", int(port)), None)
+            if other:
+                TABLE[("TCP", int(port))] = (other[0], int(port), 0, other[1])
             self.say(299, "")
         elif kind in STREAMS:
             self.stream(*STREAMS[kind])

@@ -223,6 +223,20 @@ RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, con
     return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
 }
 
+// Each outcome in one text: its name, its word, whose doing it is, and what else is known of it.
+std::vector<std::string> Texts(const tavo::PassResult& result) {
+    std::vector<std::string> rgTexts;
+    for (const tavo::Outcome& outcome : result.rgOutcomes) {
+        const tavo::Verdict& verdict = outcome.verdict;
+        rgTexts.push_back(
+            outcome.szName + " " + verdict.szWord +
+            (verdict.holder ? " " + verdict.holder->szAddress + " " + verdict.holder->szDescription : "") +
+            (verdict.blOthers ? " others" : "") + (verdict.blAnew ? " anew" : "") +
+            (outcome.blLeftOver ? " left over" : ""));
+    }
+    return rgTexts;
+}
+
 TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     MemoryRouter router;
     for (const RouterMapping& mapping :
@@ -236,9 +250,13 @@ TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     tavo::LeaseHabit habit;
     const auto fnGoOn = [] { return false; };
     const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn);
-    const std::vector<std::pair<std::string, std::string>> rgExpected = {
-        {"1/tcp", "1"}, {"3/tcp", "1"}, {"4/tcp", "718"}, {"5/tcp", "1"}, {"6/tcp", "718"}, {"7/tcp", "1"}};
-    EXPECT_EQ(result.rgStatus, rgExpected);
+    std::vector<std::string> rgExpected = {"1/tcp 1",
+                                           "3/tcp 1 anew",
+                                           "4/tcp 718 192.168.1.9 tavo:theirs",
+                                           "5/tcp 1 others",
+                                           "6/tcp 718 192.168.1.5 game others",
+                                           "7/tcp 1 anew"};
+    EXPECT_EQ(Texts(result), rgExpected);
     EXPECT_EQ(router.mMapTable.size(), 6U);
     EXPECT_EQ(router.mMapTable.count({"TCP", 2}), 0U);
     EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
@@ -247,7 +265,9 @@ TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     EXPECT_EQ(result.nShortestLease, 100U);
 
     router.mNCalls = 0;
-    EXPECT_EQ(tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn).rgStatus, rgExpected);
+    rgExpected[1] = "3/tcp 1";
+    rgExpected[5] = "7/tcp 1";
+    EXPECT_EQ(Texts(tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn)), rgExpected);
     EXPECT_EQ(router.mNCalls, 1);
     tavo::Reconcile(router, rgWanted, kBox, habit, true, fnGoOn);  // leases due: each own one asked for again
     EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), habit.nLease);
@@ -275,10 +295,10 @@ TEST(Reconcile, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
         tavo::LeaseHabit habit;
         const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, [] { return false; });
         EXPECT_EQ(router.mNCalls, nCalls);
-        ASSERT_EQ(result.rgStatus.size(), 10U);
-        EXPECT_EQ(result.rgStatus[4].second, szFifth);
-        EXPECT_EQ(std::count_if(result.rgStatus.begin(), result.rgStatus.end(),
-                                [](const auto& status) { return status.second == "1"; }),
+        ASSERT_EQ(result.rgOutcomes.size(), 10U);
+        EXPECT_EQ(result.rgOutcomes[4].verdict.szWord, szFifth);
+        EXPECT_EQ(std::count_if(result.rgOutcomes.begin(), result.rgOutcomes.end(),
+                                [](const tavo::Outcome& outcome) { return outcome.verdict.szWord == "1"; }),
                   nSwallowed == 0 ? 10 : 9);
     }
 }
@@ -290,7 +310,7 @@ TEST(Reconcile, WhatTheRouterDoesNotTakeAwayIsReported) {
     router.mNRemoveCode = 606;
     tavo::LeaseHabit habit;
     const auto result = tavo::Reconcile(router, {Entry(2, 2, "", "tavo:a")}, kBox, habit, false, [] { return false; });
-    EXPECT_EQ(result.rgStatus, (tavo::StatusList{{"2/tcp", "606"}, {"1/tcp (left over)", "606"}}));
+    EXPECT_EQ(Texts(result), (std::vector<std::string>{"2/tcp 606", "1/tcp 606 left over"}));
 }
 
 TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {
@@ -299,7 +319,7 @@ TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {
     router.mNListCode = tavo::kRouterTimeout;
     tavo::LeaseHabit habit;
     const auto result = tavo::Reconcile(router, {Entry(1, 1, "", "tavo:a")}, kBox, habit, false, [] { return false; });
-    EXPECT_EQ(result.rgStatus.front().second, "timeout");
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp timeout"});
     EXPECT_EQ(result.nTransport, tavo::kRouterTimeout);
     EXPECT_EQ(router.mMapTable.size(), 1U);
 }

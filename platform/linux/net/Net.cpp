@@ -5,7 +5,6 @@
 
 #include <arpa/inet.h>
 #include <net/if.h>
-#include <netlink/netlink.h>
 #include <netlink/route/addr.h>
 #include <netlink/route/link.h>
 #include <netlink/route/route.h>
@@ -14,11 +13,11 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
-#include <memory>
 #include <optional>
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "net/Netlink.h"
 
 namespace {
 
@@ -32,22 +31,9 @@ int Fail(int nErr, int nLine) {
     return -1;
 }
 
-struct SocketFree {
-    void operator()(nl_sock* pSocket) const { nl_socket_free(pSocket); }
-};
-struct CacheFree {
-    void operator()(nl_cache* pCache) const { nl_cache_free(pCache); }
-};
-using NetlinkSocket = std::unique_ptr<nl_sock, SocketFree>;
-using Cache = std::unique_ptr<nl_cache, CacheFree>;
-
-NetlinkSocket Connect() {
-    NetlinkSocket pSocket(nl_socket_alloc());
-    if (pSocket && nl_connect(pSocket.get(), NETLINK_ROUTE) < 0) {
-        pSocket.reset();
-    }
-    return pSocket;
-}
+using tavo::Cache;
+using tavo::Connect;
+using tavo::NetlinkSocket;
 
 // The IPv4 next hop of a default route; nothing for any other route.
 std::optional<in_addr> DefaultNextHop(rtnl_route* pRoute) {

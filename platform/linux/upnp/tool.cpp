@@ -51,9 +51,9 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
     tavo::LeaseHabit habit;
     const tavo::PassResult result = tavo::Reconcile(igd, rgWanted, szBox, habit, false, [] { return false; });
     int nMissing = 0;
-    for (const auto& [szName, szStatus] : result.rgStatus) {
-        if (szStatus != "1") {
-            std::printf("%s: %s\n", szName.c_str(), szStatus.c_str());
+    for (const tavo::Outcome& outcome : result.rgOutcomes) {
+        if (outcome.verdict.szWord != "1") {
+            std::printf("%s: %s\n", outcome.szName.c_str(), outcome.verdict.szWord.c_str());
             ++nMissing;
         }
     }

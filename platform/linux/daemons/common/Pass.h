@@ -4,23 +4,19 @@
 
 #include <chrono>
 #include <functional>
-#include <string>
-#include <utility>
-#include <vector>
 
+#include "daemons/common/Outcome.h"
 #include "upnp/Router.h"
 
 namespace tavo {
 
-// Mapping names, each with "1" or the code or word of failure.
-using StatusList = std::vector<std::pair<std::string, std::string>>;
-
 struct PassResult {
-    StatusList rgStatus;
+    OutcomeList rgOutcomes;       // those of the wanted mappings first, in their order
     uint32_t nShortestLease = 0;  // seconds granted; 0: all permanent
     int nTransport = kRouterOk;   // below 0: why the router could not be spoken to
     bool blStopped = false;
     bool blRenewed = false;  // every lease was asked for anew, due or not
+    RouterState enRouter = RouterState::kNotAsked;
 };
 
 class PassGuard {

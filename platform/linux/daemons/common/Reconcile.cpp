@@ -18,6 +18,7 @@ namespace {
 constexpr auto kReadBackAfter = std::chrono::seconds(20);  // a slow router's yes is not left open for longer
 constexpr int kRangeFrom = 4;                              // a range costs a request a protocol
 constexpr char kWritten[] = "written";                     // the router said yes, and has not shown it yet
+constexpr size_t kMaxDescription = 64;                     // of somebody else's entry
 
 using Key = std::pair<std::string, uint16_t>;
 
@@ -42,14 +43,15 @@ private:
         return entry.szClient == mSzBox && entry.nBoxPort == wanted.nBoxPort && entry.blEnabled;
     }
     void RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted);
-    std::string Place(const RouterMapping& wanted);
-    std::string Create(const RouterMapping& wanted);
+    Verdict InTheWay(const RouterMapping& entry) const;
+    Verdict Place(const RouterMapping& wanted);
+    Verdict Create(const RouterMapping& wanted);
     int AddOwn(RouterMapping mapping);
     std::map<Key, RouterMapping> ShowRanges(const std::vector<RouterMapping>& rgWanted);
     void ReadBack(const std::vector<RouterMapping>& rgWanted);
-    std::string Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown);
-    std::string AfterConflict(const RouterMapping& wanted);
-    void NoteLease(uint32_t nLease);
+    Verdict Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown);
+    Verdict AfterConflict(const RouterMapping& wanted);
+    Verdict Open(const RouterMapping& entry);
 
     Router& mRouter;
     const std::string& mSzBox;
@@ -63,10 +65,20 @@ private:
     std::chrono::steady_clock::time_point mReadBack = std::chrono::steady_clock::now();
 };
 
-void Pass::NoteLease(uint32_t nLease) {
-    if (nLease != 0 && (mResult.nShortestLease == 0 || nLease < mResult.nShortestLease)) {
-        mResult.nShortestLease = nLease;
+// A mapping that the router showed.
+Verdict Pass::Open(const RouterMapping& entry) {
+    if (entry.nLease != 0 && (mResult.nShortestLease == 0 || entry.nLease < mResult.nShortestLease)) {
+        mResult.nShortestLease = entry.nLease;
     }
+    return {PortState::kOpen, "1", {}, entry.nLease};
+}
+
+// A mapping that cannot be made because of another entry, and whose that is.
+Verdict Pass::InTheWay(const RouterMapping& entry) const {
+    Verdict verdict = Refusal(kRouterConflict);
+    verdict.holder = Holder{entry.szClient, HarmlessText(entry.szDescription, kMaxDescription)};
+    verdict.blOthers = entry.szClient == mSzBox;
+    return verdict;
 }
 
 PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
@@ -75,7 +87,7 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     if (nCode != kRouterOk) {
         mResult.nTransport = nCode < 0 ? nCode : kRouterOk;
         for (const RouterMapping& wanted : rgWanted) {
-            mResult.rgStatus.emplace_back(MappingName(wanted), CodeText(nCode));
+            mResult.rgOutcomes.push_back(OutcomeOf(wanted, Refusal(nCode)));
         }
         return mResult;
     }
@@ -89,8 +101,7 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     }
     RemoveUnwanted(mapWanted);
     for (const RouterMapping& wanted : rgWanted) {
-        const std::string szStatus = IsOver() ? CodeText(mResult.nTransport) : Place(wanted);
-        mResult.rgStatus.emplace_back(MappingName(wanted), szStatus);
+        mResult.rgOutcomes.push_back(OutcomeOf(wanted, IsOver() ? Refusal(mResult.nTransport) : Place(wanted)));
         if (std::chrono::steady_clock::now() - mReadBack > kReadBackAfter) {
             ReadBack(rgWanted);
         }
@@ -98,7 +109,10 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     ReadBack(rgWanted);
     for (const auto& [key, nKept] : mMapKept) {
         if (!mapWanted.contains(key)) {
-            mResult.rgStatus.emplace_back(MappingName(mMapTable[key]) + " (left over)", CodeText(nKept));
+            Outcome outcome = OutcomeOf(mMapTable[key], Refusal(nKept));
+            outcome.blLeftOver = true;
+            outcome.verdict.nLease = mMapTable[key].nLease;
+            mResult.rgOutcomes.push_back(std::move(outcome));
         }
     }
     return mResult;
@@ -122,32 +136,35 @@ void Pass::RemoveUnwanted(const std::map<Key, RouterMapping>& mapWanted) {
     }
 }
 
-std::string Pass::Place(const RouterMapping& wanted) {
+Verdict Pass::Place(const RouterMapping& wanted) {
     const auto it = mMapTable.find(KeyOf(wanted));
     if (it == mMapTable.end()) {
         return Create(wanted);
     }
     if (!Serves(it->second, wanted)) {
         const auto kept = mMapKept.find(it->first);
-        return CodeText(kept == mMapKept.end() ? kRouterConflict : kept->second);
+        return kept == mMapKept.end() ? InTheWay(it->second) : Refusal(kept->second);
     }
     if (!IsOwn(it->second)) {
-        return "1";  // another program of the box made just this one; it is that program's to renew
+        Verdict verdict{PortState::kOpen, "1", {}, it->second.nLease};
+        verdict.blOthers = true;  // and it is that program's to renew
+        return verdict;
     }
     const bool blDue = mBlRenew && it->second.nLease != 0;
     if (blDue && Note(AddOwn(wanted)) == kRouterOk) {
-        return kWritten;
+        return {PortState::kOpen, kWritten};
     }
-    NoteLease(it->second.nLease);
-    return "1";
+    return Open(it->second);
 }
 
-std::string Pass::Create(const RouterMapping& wanted) {
+Verdict Pass::Create(const RouterMapping& wanted) {
     const int nCode = Note(AddOwn(wanted));
     if (nCode == kRouterConflict) {
         return AfterConflict(wanted);
     }
-    return nCode == kRouterOk ? kWritten : CodeText(nCode);
+    Verdict verdict = nCode == kRouterOk ? Verdict{PortState::kOpen, kWritten} : Refusal(nCode);
+    verdict.blAnew = nCode == kRouterOk;
+    return verdict;
 }
 
 int Pass::AddOwn(RouterMapping mapping) {
@@ -159,8 +176,8 @@ int Pass::AddOwn(RouterMapping mapping) {
 std::map<Key, RouterMapping> Pass::ShowRanges(const std::vector<RouterMapping>& rgWanted) {
     std::map<std::string, std::pair<uint16_t, uint16_t>> mapRanges;
     int nWritten = 0;
-    for (size_t i = mNRead; i < mResult.rgStatus.size(); ++i) {
-        if (mResult.rgStatus[i].second == kWritten) {
+    for (size_t i = mNRead; i < mResult.rgOutcomes.size(); ++i) {
+        if (mResult.rgOutcomes[i].verdict.szWord == kWritten) {
             const uint16_t nPort = rgWanted[i].nRouterPort;
             auto& range = mapRanges.try_emplace(rgWanted[i].szProtocol, nPort, nPort).first->second;
             range = {std::min(range.first, nPort), std::max(range.second, nPort)};
@@ -182,52 +199,56 @@ std::map<Key, RouterMapping> Pass::ShowRanges(const std::vector<RouterMapping>& 
 // A router's yes is not enough: the mapping must be in its table, and be ours.
 void Pass::ReadBack(const std::vector<RouterMapping>& rgWanted) {
     const std::map<Key, RouterMapping> mapShown = ShowRanges(rgWanted);
-    for (; mNRead < mResult.rgStatus.size(); ++mNRead) {
-        if (mResult.rgStatus[mNRead].second == kWritten) {
-            mResult.rgStatus[mNRead].second = Confirm(rgWanted[mNRead], mapShown);
+    for (; mNRead < mResult.rgOutcomes.size(); ++mNRead) {
+        Verdict& verdict = mResult.rgOutcomes[mNRead].verdict;
+        if (verdict.szWord == kWritten) {
+            const bool blAnew = verdict.blAnew;
+            verdict = Confirm(rgWanted[mNRead], mapShown);
+            verdict.blAnew = blAnew && verdict.enState == PortState::kOpen;
         }
     }
     mReadBack = std::chrono::steady_clock::now();
 }
 
-std::string Pass::Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown) {
+Verdict Pass::Confirm(const RouterMapping& wanted, const std::map<Key, RouterMapping>& mapShown) {
     const auto it = mapShown.find(KeyOf(wanted));
     if (it != mapShown.end() && Serves(it->second, wanted)) {
-        NoteLease(it->second.nLease);
-        return "1";
+        return Open(it->second);
     }
     if (IsOver()) {
-        return CodeText(mResult.nTransport);
+        return Refusal(mResult.nTransport);
     }
     RouterMapping entry;
     const int nCode = Note(mRouter.Get(wanted.szProtocol, wanted.nRouterPort, entry));
+    const Verdict lost{PortState::kRefused, "lost"};
     if (nCode == kRouterNoSuchEntry) {
-        return "lost";
+        return lost;
     }
     if (nCode != kRouterOk) {
-        return CodeText(nCode);
+        return Refusal(nCode);
     }
     if (!Serves(entry, wanted)) {
-        return entry.szClient == mSzBox ? "lost" : CodeText(kRouterConflict);
+        return entry.szClient == mSzBox ? lost : InTheWay(entry);
     }
-    NoteLease(entry.nLease);
-    return "1";
+    return Open(entry);
 }
 
 // The listing did not show who is in the way; ask for this port alone.
-std::string Pass::AfterConflict(const RouterMapping& wanted) {
+Verdict Pass::AfterConflict(const RouterMapping& wanted) {
     RouterMapping entry;
     if (Note(mRouter.Get(wanted.szProtocol, wanted.nRouterPort, entry)) != kRouterOk) {
-        return CodeText(kRouterConflict);  // a router that guards its entries does not even show them
+        return Refusal(kRouterConflict);  // a router that guards its entries does not even show them
     }
     if (Serves(entry, wanted)) {
-        return "1";
+        Verdict verdict{PortState::kOpen, "1", {}, entry.nLease};
+        verdict.blOthers = !IsOwn(entry);
+        return verdict;
     }
     if (!IsOwn(entry) || Note(mRouter.Remove(wanted.szProtocol, wanted.nRouterPort)) != kRouterOk) {
-        return CodeText(kRouterConflict);
+        return InTheWay(entry);
     }
     const int nCode = Note(AddOwn(wanted));
-    return nCode == kRouterOk ? kWritten : CodeText(nCode);
+    return nCode == kRouterOk ? Verdict{PortState::kOpen, kWritten} : Refusal(nCode);
 }
 
 }  // namespace
@@ -245,6 +266,10 @@ std::string CodeText(int nCode) {
         default:
             return std::to_string(nCode);
     }
+}
+
+Verdict Refusal(int nCode) {
+    return {nCode > 0 ? PortState::kRefused : nCode == 0 ? PortState::kWaiting : PortState::kUnknown, CodeText(nCode)};
 }
 
 // Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.

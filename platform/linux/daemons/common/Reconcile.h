@@ -27,5 +27,7 @@ PassResult Reconcile(Router& router, const std::vector<RouterMapping>& rgWanted,
 
 // The text of a failure in the status file: the protocol's code, or "timeout", "unreachable", "garbage".
 std::string CodeText(int nCode);
+// A mapping that is not there, as the router's code has it.
+Verdict Refusal(int nCode);
 
 }  // namespace tavo

@@ -7,8 +7,10 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <ctime>
 
 #include "core/TextFile.h"
+#include "net/Neighbour.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
 
@@ -22,6 +24,9 @@ constexpr int kRetrySeconds = 10;
 constexpr int kWithdrawTries = 3;
 constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
 constexpr size_t kAddressSize = 16;
+constexpr int kPassesToOutside = 5;
+constexpr char kNoAddress[] = "0.0.0.0";  // how a router says that it has none
+constexpr char kNoLink[] = "the network cable is out, or the network is down";
 
 int Setting(const char* szSection, const char* szKey, const char* szDefault, int nLeast, int nMost) {
     char szValue[16];
@@ -62,6 +67,8 @@ bool RuleMapper::FindGateway() {
         mSzGateway = szGateway;
         mSzBox = szBox;
         mNLease = 0;
+        mNUntilOutside = 0;
+        mSzOutside.clear();
         NewGateway();
     }
     return blFound;
@@ -74,19 +81,23 @@ bool RuleMapper::TakeTurn(const std::function<bool()>& fnStop) {
     return mTurn.Take([&] { return IsSwitchedOn() && !fnStop() && BootClock::now() < end; });
 }
 
-PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord) {
+PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter) {
+    const PortState enState = enRouter == RouterState::kBusy ? PortState::kWaiting : PortState::kUnknown;
     PassResult result;
     for (const RouterMapping& wanted : rgWanted) {
-        result.rgStatus.emplace_back(MappingName(wanted), szWord);
+        result.rgOutcomes.push_back(OutcomeOf(wanted, {enState, szWord}));
     }
     result.nTransport = kRouterUnreachable;
+    result.enRouter = enRouter;
     return result;
 }
 
 PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnStop) {
     if (!TakeTurn(fnStop)) {
-        PassResult result = Failed(mWanted.rgMappings, "busy");
-        result.nTransport = IsSwitchedOn() ? kRouterTimeout : kRouterOk;
+        const bool blSwitchedOn = IsSwitchedOn();
+        PassResult result =
+            Failed(mWanted.rgMappings, "busy", blSwitchedOn ? RouterState::kBusy : RouterState::kNotAsked);
+        result.nTransport = blSwitchedOn ? kRouterTimeout : kRouterOk;
         result.blStopped = fnStop();
         return result;
     }
@@ -94,7 +105,7 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
         return {};  // not knowing the rules is no reason to take anything away
     }
     if (!FindGateway()) {
-        return Failed(mWanted.rgMappings, "nogateway");
+        return Failed(mWanted.rgMappings, "nogateway", RouterState::kNoGateway);
     }
     const auto now = BootClock::now();
     const bool blDue = mNLease != 0 && now - mRenewed >= std::chrono::seconds(mNLease / 2);
@@ -111,14 +122,19 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
     if (blRequested) {
         ReadRules();
     }
-    const PassResult result = Pass(blRequested, fnStop);
+    PassResult result = Pass(blRequested, fnStop);
+    AddRules(result.rgOutcomes);
     if (!result.blStopped) {
-        WriteResults(result);
+        WriteResults(result.rgOutcomes);
         if (!IsSwitchedOn()) {
             mTurn.GiveBack();
         }
     }
-    return SecondsToNext(result);
+    const int nSeconds = SecondsToNext(result);
+    if (!result.blStopped) {
+        PublishPass(std::move(result), nSeconds, fnStop);
+    }
+    return nSeconds;
 }
 
 int RuleMapper::SecondsToNext(const PassResult& result) {
@@ -139,23 +155,80 @@ int RuleMapper::SecondsToNext(const PassResult& result) {
     return static_cast<int>(std::clamp<int64_t>(nLeft, 1, mNCheckSeconds));
 }
 
-void RuleMapper::WriteResults(PassResult result) const {
-    result.rgStatus.insert(result.rgStatus.end(), mWanted.rgRefused.begin(), mWanted.rgRefused.end());
-    if (!mWanted.blReadable) {
-        result.rgStatus.emplace_back("rule.conf", "unreadable");
+// What the rules themselves say of the outcomes: whose they are, and what was not asked of the router at all.
+void RuleMapper::AddRules(OutcomeList& rgOutcomes) const {
+    for (Outcome& outcome : rgOutcomes) {
+        const auto it = mWanted.mapRules.find(outcome.szName);
+        outcome.szRule = it == mWanted.mapRules.end() || outcome.blLeftOver ? "" : it->second;
     }
-    if (!WriteFileAtomic(mNames.szResultFile, ResultText(result.rgStatus), kResultMode)) {
+    rgOutcomes.insert(rgOutcomes.end(), mWanted.rgRefused.begin(), mWanted.rgRefused.end());
+}
+
+void RuleMapper::WriteResults(const OutcomeList& rgOutcomes) const {
+    OutcomeList rgAll = rgOutcomes;
+    if (!mWanted.blReadable) {
+        rgAll.push_back({"rule.conf", {PortState::kUnknown, "unreadable"}});
+    }
+    if (!WriteFileAtomic(mNames.szResultFile, ResultText(rgAll), kResultMode)) {
         syslog(LOG_ERR, "cannot write %s", mNames.szResultFile);
     }
 }
 
+// Tells a router that is not there from one that does not do what it is asked for.
+void RuleMapper::LookAtRouter(Published& state, const std::function<bool()>& fnStop) {
+    const bool blLost = state.enRouter == RouterState::kNoService || state.enRouter == RouterState::kSilent;
+    char szInterface[kAddressSize];
+    const bool blLink = (!blLost && state.enRouter != RouterState::kNoGateway) ||
+                        checkGwIfEnable(szInterface, sizeof(szInterface)) == 0;
+    if (blLost && (!blLink || !IsNeighbourThere(mSzGateway, fnStop))) {
+        state.enRouter = RouterState::kUnreachable;
+    }
+    state.szRouterWhy = blLink ? WhyOf(state.enRouter, mNames.szProtocol) : kNoLink;
+    state.szHardware = HardwareAddress(mSzGateway);
+}
+
+// Every few passes, and as soon as the router is back.
+void RuleMapper::AskOutside(const std::function<bool()>& fnStop) {
+    if (--mNUntilOutside > 0) {
+        return;
+    }
+    mNUntilOutside = kPassesToOutside;
+    mSzOutside = Outside(fnStop);
+    if (mSzOutside == kNoAddress) {
+        mSzOutside.clear();
+    }
+}
+
+void RuleMapper::PublishPass(PassResult result, int nSecondsToNext, const std::function<bool()>& fnStop) {
+    Published state{mNames.szName, mNames.szProtocol};
+    state.blSwitchedOn = IsSwitchedOn();
+    state.blRulesReadable = mWanted.blReadable;
+    state.szGateway = mSzGateway;
+    state.szBox = mSzBox;
+    state.enRouter = result.enRouter;
+    state.rgOutcomes = std::move(result.rgOutcomes);
+    LookAtRouter(state, fnStop);
+    if (state.enRouter == RouterState::kOk) {
+        AskOutside(fnStop);
+    } else {
+        mNUntilOutside = 0;
+    }
+    state.szOutside = mSzOutside;
+    state.nAt = std::time(nullptr);
+    state.nNextLook = state.nAt + nSecondsToNext;
+    NoteSince(mPublished, state);
+    Publish(state);
+    mPublished = std::move(state);
+}
+
 void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
+    Unpublish(mNames.szName);
     if (!mTurn.Take([] { return false; })) {
         return;
     }
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = Map({}, false, fnStop);
-        if (result.nTransport == kRouterOk && result.rgStatus.empty()) {
+        if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
             return;
         }
     }

@@ -1,8 +1,8 @@
 // What the mapping side of both daemons does alike: rules, results, the gateway and the box's address, the
 // clock of checks, renewals and retries. Relies on the settings, the rule file and the platform's addresses;
 // the protocol is spoken by the class derived from it.
-// Promises: the result file is removed when a request begins and complete when its pass has ended; the
-// router is spoken to only while the other daemon does not.
+// Promises: the result file is removed when a request begins and complete when its pass has ended; what is known
+// is published after each pass; the router is spoken to only while the other daemon does not.
 #pragma once
 
 #include <functional>
@@ -12,6 +12,7 @@
 
 #include "daemons/common/BootClock.h"
 #include "daemons/common/Daemon.h"
+#include "daemons/common/Published.h"
 #include "daemons/common/Reconcile.h"
 #include "daemons/common/RouterTurn.h"
 #include "daemons/common/Wanted.h"
@@ -34,14 +35,16 @@ protected:
     virtual PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
                            const std::function<bool()>& fnStop) = 0;
     // The result file's text, of names and words of all that was asked for; "1" is success.
-    virtual std::string ResultText(const StatusList& rgStatus) const = 0;
+    virtual std::string ResultText(const OutcomeList& rgOutcomes) const = 0;
+    // The router's address on its other side; empty when it does not say.
+    virtual std::string Outside(const std::function<bool()>& fnStop) = 0;
     // The gateway or the box's own address is another one: nothing of what was known holds.
     virtual void NewGateway() = 0;
     // Several passes in a row have failed.
     virtual void LostRouter() {}
 
     // What a pass that failed as a whole says of each mapping.
-    static PassResult Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord);
+    static PassResult Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter);
 
     const std::string& Gateway() const { return mSzGateway; }
     const std::string& Box() const { return mSzBox; }
@@ -52,8 +55,12 @@ private:
     bool FindGateway();
     bool TakeTurn(const std::function<bool()>& fnStop);
     PassResult Pass(bool blRequested, const std::function<bool()>& fnStop);
-    void WriteResults(PassResult result) const;
+    void AddRules(OutcomeList& rgOutcomes) const;
+    void WriteResults(const OutcomeList& rgOutcomes) const;
     int SecondsToNext(const PassResult& result);
+    void LookAtRouter(Published& state, const std::function<bool()>& fnStop);
+    void AskOutside(const std::function<bool()>& fnStop);
+    void PublishPass(PassResult result, int nSecondsToNext, const std::function<bool()>& fnStop);
 
     const DaemonNames& mNames;
     bool mBlRequestRenews;
@@ -67,6 +74,9 @@ private:
     int mNFailures = 0;
     uint32_t mNLease = 0;  // seconds that the router grants
     BootClock::time_point mRenewed;
+    std::string mSzOutside;
+    int mNUntilOutside = 0;  // passes until the router is asked for it again
+    Published mPublished;    // as of the last pass
 };
 
 }  // namespace tavo

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <map>
 #include <memory>
+#include <utility>
 
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
@@ -27,10 +28,26 @@ std::string KeyText(const std::string& szText) {
     return szKey;
 }
 
-// "5000/tcp (web)": the port as the one rule asks for it, beside "5000/tcp", which another rule has.
-std::string DuplicateName(const RouterMapping& mapping, const TAVO_PF_CONF* pRule) {
+// The service that a rule is for, else the rule's number.
+std::string ServiceOf(const TAVO_PF_CONF* pRule) {
     const std::string szService = Value(pRule, "service");
-    return KeyText(MappingName(mapping) + " (" + (szService.empty() ? pRule->szSection : szService) + ")");
+    return szService.empty() ? pRule->szSection : szService;
+}
+
+// What no router is asked for, under a name for the status file.
+Outcome RefusedRule(const std::string& szName, const char* szWord, const TAVO_PF_CONF* pRule) {
+    Outcome outcome{KeyText(szName), {PortState::kRefused, szWord}};
+    outcome.szRule = HarmlessText(ServiceOf(pRule), kMaxRuleText);
+    return outcome;
+}
+
+// "5000/tcp (web)": the port as the one rule asks for it, beside "5000/tcp", which another rule has.
+Outcome Duplicate(const RouterMapping& mapping, const TAVO_PF_CONF* pRule) {
+    Outcome outcome = RefusedRule(MappingName(mapping) + " (" + ServiceOf(pRule) + ")", "duplicate", pRule);
+    outcome.szProtocol = mapping.szProtocol;
+    outcome.nRouterPort = mapping.nRouterPort;
+    outcome.nBoxPort = mapping.nBoxPort;
+    return outcome;
 }
 
 // Takes a rule's single mappings in; the first rule that asks for a port has it.
@@ -41,9 +58,10 @@ void AddRule(const TAVO_PF_CONF* pRule, const std::vector<SingleMapping>& rgSing
             single.szProtocol, single.nRouterPort, single.nBoxPort, "", MappingDescription(pRule), 0, true};
         const auto [it, blNew] = mapBoxPorts.try_emplace(MappingName(mapping), mapping.nBoxPort);
         if (blNew) {
+            wanted.mapRules[it->first] = HarmlessText(ServiceOf(pRule), kMaxRuleText);
             wanted.rgMappings.push_back(std::move(mapping));
         } else if (it->second != mapping.nBoxPort) {
-            wanted.rgRefused.emplace_back(DuplicateName(mapping, pRule), "duplicate");
+            wanted.rgRefused.push_back(Duplicate(mapping, pRule));
         }
     }
 }
@@ -51,9 +69,8 @@ void AddRule(const TAVO_PF_CONF* pRule, const std::vector<SingleMapping>& rgSing
 }  // namespace
 
 std::string MappingDescription(const TAVO_PF_CONF* pRule) {
-    const std::string szService = Value(pRule, "service");
     std::string szText = kOwnPrefix;
-    for (const char c : szService.empty() ? std::string(pRule->szSection) : szService) {
+    for (const char c : ServiceOf(pRule)) {
         szText += c >= ' ' && c <= '~' ? c : '_';
     }
     return szText.substr(0, kMaxDescription);
@@ -86,7 +103,7 @@ WantedSet ReadWanted(const char* szRunKey) {
         if (rgSingles) {
             AddRule(pRule, *rgSingles, mapBoxPorts, wanted);
         } else {
-            wanted.rgRefused.emplace_back(RuleName(pRule), "invalid");
+            wanted.rgRefused.push_back(RefusedRule(RuleName(pRule), "invalid", pRule));
         }
     }
     return wanted;
@@ -94,6 +111,10 @@ WantedSet ReadWanted(const char* szRunKey) {
 
 std::string MappingName(const RouterMapping& mapping) {
     return PortName(mapping.szProtocol, mapping.nRouterPort);
+}
+
+Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
+    return {MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort};
 }
 
 }  // namespace tavo

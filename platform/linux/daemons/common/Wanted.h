@@ -3,10 +3,11 @@
 // empty one, so that nothing is taken away because of it.
 #pragma once
 
+#include <map>
 #include <string>
 #include <vector>
 
-#include "daemons/common/Pass.h"
+#include "daemons/common/Outcome.h"
 #include "tavo/portforward.h"
 #include "upnp/Router.h"
 
@@ -16,7 +17,8 @@ struct WantedSet {
     std::vector<RouterMapping> rgMappings;  // client and lease still to be filled
     // What no router is asked for, as text for a user: rules whose ports cannot be paired ("invalid"), and
     // ports that an earlier rule sends to another port of the box ("duplicate").
-    StatusList rgRefused;
+    OutcomeList rgRefused;
+    std::map<std::string, std::string> mapRules;  // which rule asked for a mapping, by the mapping's name
     bool blReadable = true;
 };
 
@@ -34,5 +36,7 @@ std::string RuleName(const TAVO_PF_CONF* pRule);
 
 // "5000/tcp", as a user reads it.
 std::string MappingName(const RouterMapping& mapping);
+// What became of a mapping.
+Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict);
 
 }  // namespace tavo

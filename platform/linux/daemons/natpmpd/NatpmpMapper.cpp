@@ -54,6 +54,7 @@ NatpmpMapper::NatpmpMapper() : RuleMapper(kNames, true), mFdAnnouncements(Listen
 void NatpmpMapper::NewGateway() {
     mState.epoch = EpochWatch();
     mState.mapRemapped.clear();
+    mState.szOutside.clear();
     // What was held here before is as doubtful as what was read from the file.
     for (auto& [key, held] : mState.held.mRows) {
         held.nLifetime = 0;
@@ -88,9 +89,10 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
 }
 
 // What is wrong, for a user: whatever stands here makes a save fail, so nothing does when all is well.
-std::string NatpmpMapper::ResultText(const StatusList& rgStatus) const {
+std::string NatpmpMapper::ResultText(const OutcomeList& rgOutcomes) const {
     std::string szText;
-    for (const auto& [szName, szWord] : rgStatus) {
+    for (const Outcome& outcome : rgOutcomes) {
+        const std::string& szWord = outcome.verdict.szWord;
         if (szWord == "1") {
             continue;
         }
@@ -98,9 +100,14 @@ std::string NatpmpMapper::ResultText(const StatusList& rgStatus) const {
         for (const auto& [szCommon, szHere] : kCommonWords) {
             szShown = szWord == szCommon ? szHere : szShown;
         }
-        szText += (szText.empty() ? "" : ", ") + szName + " (" + szShown + ")";
+        szText += (szText.empty() ? "" : ", ") + outcome.szName + " (" + szShown + ")";
     }
     return szText;
+}
+
+// Each pass has asked for it already.
+std::string NatpmpMapper::Outside(const std::function<bool()>& /*fnStop*/) {
+    return mState.szOutside;
 }
 
 }  // namespace tavo

@@ -20,7 +20,8 @@ public:
 private:
     PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
                    const std::function<bool()>& fnStop) override;
-    std::string ResultText(const StatusList& rgStatus) const override;
+    std::string ResultText(const OutcomeList& rgOutcomes) const override;
+    std::string Outside(const std::function<bool()>& fnStop) override;
     void NewGateway() override;
 
     Descriptor mFdAnnouncements;

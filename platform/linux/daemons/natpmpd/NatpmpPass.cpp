@@ -16,6 +16,26 @@ namespace {
 // would be answered with the first, and giving that back would end it.
 constexpr char kShared[] = "another rule has this port of the box; NAT-PMP gives it one router port only";
 
+RouterState StateOf(int nTransport) {
+    switch (nTransport) {
+        case kRouterOk:
+            return RouterState::kOk;
+        case kRouterUnreachable:
+            return RouterState::kNoService;
+        default:
+            return RouterState::kSilent;
+    }
+}
+
+Verdict Refusal(int nCode, std::string szWords) {
+    return {nCode < 0 ? PortState::kUnknown : PortState::kRefused, std::move(szWords)};
+}
+
+Verdict Open(const Held& held) {
+    const time_t nLeft = held.nExpiry - std::time(nullptr);
+    return {PortState::kOpen, "1", {}, static_cast<uint32_t>(std::clamp<time_t>(nLeft, 1, UINT32_MAX))};
+}
+
 }  // namespace
 
 NatpmpPass::NatpmpPass(NatpmpState& state, const std::string& szGateway, const std::string& szBox,
@@ -60,9 +80,9 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
         return mResult;
     }
     // One question that changes nothing tells whether the gateway answers, and whether it has restarted.
-    std::string szPublic;
-    const int nCode = mClient.AskAddress(szPublic);
+    const int nCode = mClient.AskAddress(mState.szOutside);
     const bool blRestarted = mState.epoch.TakeRestart();
+    mBlLost = blRestarted;
     if (blRestarted) {
         syslog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
     }
@@ -74,6 +94,7 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
     NoteIntents();
     PlaceAll(rgWanted);
     if (mState.epoch.TakeRestart()) {  // it restarted while we spoke
+        mBlLost = true;
         Doubt();
         NoteIntents();
         PlaceAll(rgWanted);
@@ -81,13 +102,18 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
     mState.held.Save();
     mState.blSilent = mResult.nTransport != kRouterOk;
     NoteLease();
-    mResult.rgStatus.insert(mResult.rgStatus.end(), mRgOpen.begin(), mRgOpen.end());
+    mResult.rgOutcomes.insert(mResult.rgOutcomes.end(), mRgOpen.begin(), mRgOpen.end());
+    mResult.enRouter = StateOf(mResult.nTransport);
     return mResult;
 }
 
 void NatpmpPass::ReportOpen(const HeldKey& key, int nCode) {
     const RouterMapping mapping{key.szProtocol, mState.held.mRows.at(key).nRouterPort, key.nBoxPort, "", "", 0, true};
-    mRgOpen.emplace_back(MappingName(mapping), "still open: " + NatpmpWords(nCode));
+    const time_t nLeft = mState.held.mRows.at(key).nExpiry - std::time(nullptr);
+    Outcome outcome = OutcomeOf(mapping, Refusal(nCode, "still open: " + NatpmpWords(nCode)));
+    outcome.verdict.nLease = static_cast<uint32_t>(std::clamp<time_t>(nLeft, 0, UINT32_MAX));
+    outcome.blLeftOver = true;
+    mRgOpen.push_back(std::move(outcome));
 }
 
 // Takes away what the rules no longer ask for, and what they ask for at another router port.
@@ -109,58 +135,67 @@ void NatpmpPass::RemoveUnwanted() {
 void NatpmpPass::NoteIntents() {
     for (const auto& [key, pWanted] : mMapWanted) {
         if (mState.mapRemapped.count(MappingName(*pWanted)) == 0) {
-            mState.held.mRows.emplace(key, Held{pWanted->nRouterPort, 0, std::time(nullptr) + mNWishedLease});
+            const Held intent{pWanted->nRouterPort, 0, std::time(nullptr) + mNWishedLease};
+            if (mState.held.mRows.emplace(key, intent).second) {
+                mSetNew.insert(key);
+            }
         }
     }
     mState.held.Save();
 }
 
 void NatpmpPass::PlaceAll(const std::vector<RouterMapping>& rgWanted) {
-    mResult.rgStatus.clear();
+    mResult.rgOutcomes.clear();
     for (const RouterMapping& wanted : rgWanted) {
         const bool blShared = mMapWanted.at(KeyOf(wanted)) != &wanted;
-        const std::string szStatus =
-            mGuard.IsOver() ? NatpmpWords(mResult.nTransport) : (blShared ? kShared : Place(wanted));
-        mResult.rgStatus.emplace_back(MappingName(wanted), szStatus);
+        const Verdict verdict = mGuard.IsOver() ? Refusal(mResult.nTransport, NatpmpWords(mResult.nTransport))
+                                : blShared      ? Verdict{PortState::kRefused, kShared}
+                                                : Place(wanted);
+        mResult.rgOutcomes.push_back(OutcomeOf(wanted, verdict));
     }
 }
 
-std::string NatpmpPass::Place(const RouterMapping& wanted) {
+Verdict NatpmpPass::Place(const RouterMapping& wanted) {
     const auto remapped = mState.mapRemapped.find(MappingName(wanted));
     if (remapped != mState.mapRemapped.end()) {
-        return remapped->second;
+        return {PortState::kRefused, remapped->second};
     }
     Held& held = mState.held.mRows.at(KeyOf(wanted));
     if (held.nRouterPort != wanted.nRouterPort) {
-        return "the router has not closed port " + std::to_string(held.nRouterPort) + " yet";
+        return {PortState::kWaiting, "the router has not closed port " + std::to_string(held.nRouterPort) + " yet"};
     }
-    return held.nLifetime != 0 ? "1" : Ask(wanted, held);
+    return held.nLifetime != 0 ? Open(held) : Ask(wanted, held);
 }
 
-std::string NatpmpPass::Ask(const RouterMapping& wanted, Held& held) {
+Verdict NatpmpPass::Ask(const RouterMapping& wanted, Held& held) {
     NatpmpGrant grant;
     const int nCode =
         mGuard.Note(mClient.Map(wanted.szProtocol, wanted.nBoxPort, wanted.nRouterPort, mNWishedLease, grant));
     if (nCode != kRouterOk) {
         held = {wanted.nRouterPort, 0, std::max(held.nExpiry, std::time(nullptr) + time_t{mNWishedLease})};
-        return NatpmpWords(nCode);
+        return Refusal(nCode, NatpmpWords(nCode));
     }
     held = {grant.nRouterPort, grant.nLifetime, std::time(nullptr) + time_t{grant.nLifetime}};
-    return grant.nRouterPort == wanted.nRouterPort ? "1" : HandBack(wanted);
+    if (grant.nRouterPort != wanted.nRouterPort) {
+        return HandBack(wanted);
+    }
+    Verdict verdict = Open(held);
+    verdict.blAnew = mBlLost || mSetNew.contains(KeyOf(wanted));
+    return verdict;
 }
 
 // The gateway opened a port that nobody asked for: it is closed before anything else is done.
-std::string NatpmpPass::HandBack(const RouterMapping& wanted) {
+Verdict NatpmpPass::HandBack(const RouterMapping& wanted) {
     const HeldKey key = KeyOf(wanted);
     std::string szWords = "the router offered " + std::to_string(mState.held.mRows.at(key).nRouterPort);
     const int nCode = mGuard.Note(mClient.Unmap(wanted.szProtocol, wanted.nBoxPort));
     if (nCode != kRouterOk) {
-        return szWords + " and has not closed it yet: " + NatpmpWords(nCode);
+        return {PortState::kRefused, szWords + " and has not closed it yet: " + NatpmpWords(nCode)};
     }
     mState.held.mRows.erase(key);
     mState.mapRemapped[MappingName(wanted)] = szWords;
     syslog(LOG_WARNING, "%s: %s; given back", MappingName(wanted).c_str(), szWords.c_str());
-    return szWords;
+    return {PortState::kRefused, szWords};
 }
 
 void NatpmpPass::NoteLease() {

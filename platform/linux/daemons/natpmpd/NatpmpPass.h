@@ -5,6 +5,7 @@
 
 #include <functional>
 #include <map>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -23,6 +24,7 @@ struct NatpmpState {
     // Mapping names, each with what the gateway offered instead. They are asked for again when leases are
     // renewed and not at each check, because each asking opens a wrong port for a moment.
     std::map<std::string, std::string> mapRemapped;
+    std::string szOutside;  // the gateway's address on its other side, as it said the last time
 };
 
 class NatpmpPass {
@@ -41,9 +43,9 @@ private:
     void RemoveUnwanted();
     void NoteIntents();
     void PlaceAll(const std::vector<RouterMapping>& rgWanted);
-    std::string Place(const RouterMapping& wanted);
-    std::string Ask(const RouterMapping& wanted, Held& held);
-    std::string HandBack(const RouterMapping& wanted);
+    Verdict Place(const RouterMapping& wanted);
+    Verdict Ask(const RouterMapping& wanted, Held& held);
+    Verdict HandBack(const RouterMapping& wanted);
     void ReportOpen(const HeldKey& key, int nCode);
     void NoteLease();
 
@@ -53,8 +55,10 @@ private:
     uint32_t mNWishedLease;
     NatpmpClient mClient;
     std::map<HeldKey, const RouterMapping*> mMapWanted;
+    bool mBlLost = false;       // the gateway has restarted since it was last spoken to
+    std::set<HeldKey> mSetNew;  // not held when the pass began
     PassResult mResult;
-    StatusList mRgOpen;  // what could not be taken away
+    OutcomeList mRgOpen;  // what could not be taken away
     PassGuard mGuard;
 };
 

@@ -13,6 +13,7 @@ namespace {
 constexpr DaemonNames kNames{
     "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
 constexpr int kDiscoveryMilliseconds = 8000;
+constexpr int kOutsideMilliseconds = 2000;
 
 }  // namespace
 
@@ -51,13 +52,14 @@ void UpnpMapper::Remember() const {
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool blRenew,
                                const std::function<bool()>& fnStop) {
     if (!FindRouter(fnStop)) {
-        PassResult result = Failed(rgWanted, "noigd");
+        PassResult result = Failed(rgWanted, "noigd", RouterState::kNoService);
         result.blStopped = fnStop();
         return result;
     }
     mPIgd->SetStop(fnStop);
     const bool blPermanentOnly = mHabit.blPermanentOnly;
-    const PassResult result = Reconcile(*mPIgd, rgWanted, Box(), mHabit, blRenew, fnStop);
+    PassResult result = Reconcile(*mPIgd, rgWanted, Box(), mHabit, blRenew, fnStop);
+    result.enRouter = result.nTransport == kRouterOk ? RouterState::kOk : RouterState::kSilent;
     if (blPermanentOnly != mHabit.blPermanentOnly) {
         Remember();
     }
@@ -75,12 +77,23 @@ PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRe
     return result;
 }
 
-std::string UpnpMapper::ResultText(const StatusList& rgStatus) const {
+std::string UpnpMapper::ResultText(const OutcomeList& rgOutcomes) const {
     std::string szText;
-    for (const auto& [szName, szCode] : rgStatus) {
-        szText += szName + "=" + szCode + "\n";
+    for (const Outcome& outcome : rgOutcomes) {
+        szText += outcome.szName + (outcome.blLeftOver ? " (left over)=" : "=") + outcome.verdict.szWord + "\n";
     }
     return szText;
+}
+
+std::string UpnpMapper::Outside(const std::function<bool()>& fnStop) {
+    std::string szAddress;
+    if (mPIgd != nullptr) {
+        mPIgd->SetStop(fnStop);
+        mPIgd->SetCallLimit(kOutsideMilliseconds);
+        mPIgd->ExternalAddress(szAddress);
+        mPIgd->SetCallLimit(kRequestMilliseconds);
+    }
+    return szAddress;
 }
 
 }  // namespace tavo

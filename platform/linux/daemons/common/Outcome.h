@@ -1,0 +1,71 @@
+// What became of each mapping that was asked for: the one list from which the result file, the published state
+// and the notices are made. Relies on nothing.
+// Promises: texts that come from the router are printable and bounded.
+#pragma once
+
+#include <cstdint>
+#include <ctime>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace tavo {
+
+// What is known of a port at the router.
+enum class PortState {
+    kOpen,
+    kRefused,
+    kWaiting,  // for something that the daemon itself is waiting for
+    kUnknown   // the router could not be asked
+};
+
+// What a pass found of the router as a whole.
+enum class RouterState {
+    kNotAsked,
+    kOk,
+    kUnreachable,  // no link, or nobody at its address
+    kNoService,    // somebody is at its address and does not map ports
+    kSilent,
+    kNoGateway,
+    kBusy  // the other daemon has its turn
+};
+
+// The other device, or other program of this box, that has a port.
+struct Holder {
+    std::string szAddress;
+    std::string szDescription;
+
+    bool operator==(const Holder&) const = default;
+};
+
+struct Verdict {
+    PortState enState = PortState::kUnknown;
+    std::string szWord = {};            // as the result file has it; "1" is success
+    std::optional<Holder> holder = {};  // of a port that was refused for it
+    uint32_t nLease = 0;                // seconds left; 0: permanent, or not known
+    bool blOthers = false;              // another program of this box made it, or has the port for something else
+    bool blAnew = false;                // open, and was not there before this pass
+};
+
+struct Outcome {
+    std::string szName;  // "5000/tcp", as a user reads it
+    Verdict verdict;
+    // What it is about; empty and 0 where a rule's ports cannot be taken apart.
+    std::string szProtocol = {};  // "TCP" or "UDP"
+    uint16_t nRouterPort = 0;
+    uint16_t nBoxPort = 0;
+    std::string szRule = {};
+    time_t nSince = 0;        // how long it has been so, in the box's own time of day
+    bool blLeftOver = false;  // no rule asks for it, and the router did not take it away
+};
+using OutcomeList = std::vector<Outcome>;
+
+// Why a port is not open, or by whose doing it is, as a user reads it; empty for an own open one.
+std::string WhyOf(const Verdict& verdict);
+// The same for the router; empty when all is well.
+std::string WhyOf(RouterState enRouter, const std::string& szProtocol);
+
+// A text from the network as valid UTF-8 without control characters, cut at nMax bytes and never inside a character.
+std::string HarmlessText(const std::string& szText, size_t nMax);
+
+}  // namespace tavo
