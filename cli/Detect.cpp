@@ -9,6 +9,7 @@
 
 #include "Box.h"
 #include "Commands.h"
+#include "KeysGuard.h"
 #include "Progress.h"
 #include "Usage.h"
 #include "Verdict.h"
@@ -50,16 +51,31 @@ void ShowStep(const DetectResult* pResult, void* pData) {
     }
 }
 
-// Detects; the result of the library's call.
+// Detects; the result of the library's call, made with the lock held.
 int Detect(DetectResult& result, bool blJson) {
     Watch watch{Progress(blJson), getpid()};
     // What stands in a buffer now would be written by the forked process, too.
     std::fflush(nullptr);
-    const int nResult = TLibDetectRouter(&result, &ShowStep, &watch, true);
+    const int nResult = TLibDetectRouter(&result, &ShowStep, &watch, false);
     if (getpid() != watch.nPid) {
         _exit(0);
     }
     return nResult;
+}
+
+// The same with the lock and the run keys looked after: detection switches the daemon of each protocol off that it
+// does not find, but it changes no settings, and the daemon that they name goes on. What kept it from beginning, or
+// nothing.
+std::optional<Reply> DetectGuarded(DetectResult& result, int& nResult, bool blJson) {
+    const Lock lock;
+    if (!lock.IsHeld()) {
+        return Busy();
+    }
+    const KeysGuard keys;
+    if (!keys.Obstacle()) {
+        nResult = Detect(result, blJson);
+    }
+    return keys.Obstacle();
 }
 
 Reply Failed(const DetectResult& result) {
@@ -147,7 +163,12 @@ Reply RunDetect(const Wish& wish, bool blJson) {
     }
     DetectResult result = {};
     result.nMaxRule = -1;
-    const int nResult = wish.blLast ? TLibGetRouterDetectResult(&result) : Detect(result, blJson);
+    int nResult = -1;
+    if (wish.blLast) {
+        nResult = TLibGetRouterDetectResult(&result);
+    } else if (const auto obstacle = DetectGuarded(result, nResult, blJson)) {
+        return *obstacle;
+    }
     // Detection fails as a whole when it found a router whose limit nobody knows; the finding stands.
     const Way enWay = WayOf(result);
     const bool blFound = enWay == Way::kUpnp || enWay == Way::kNatpmp;

@@ -7,14 +7,14 @@
 
 #include "Box.h"
 #include "Commands.h"
+#include "KeysGuard.h"
 #include "Progress.h"
 #include "RuleStore.h"
+#include "StoredRouter.h"
 
 namespace tavo::cli {
 
 namespace {
-
-using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
 
 std::string StepAt(int nPercent) {
     switch (nPercent) {
@@ -33,63 +33,12 @@ std::string StepAt(int nPercent) {
     }
 }
 
-// The router as it is stored: what it is and how it is driven.
-struct Stored {
-    bool blAny = false;
-    bool blThisGateway = false;
-    std::string szBrand, szModel, szVersion;
-    Way enWay = Way::kUnknown;
-};
-
-Stored ReadStored(const std::string& szGateway) {
-    RouterConfReader reader;  // the section that saving goes by, whatever gateway it names
-    Stored stored;
-    std::string szSection, szUpnp, szNatpmp;
-    stored.blAny = reader.GetSectionName(szSection) != 0 && !szSection.empty();
-    stored.blThisGateway = stored.blAny && szSection == szGateway;
-    reader.GetBrand(stored.szBrand);
-    reader.GetModel(stored.szModel);
-    reader.GetVersion(stored.szVersion);
-    reader.GetSupportUpnp(szUpnp);
-    reader.GetSupportNatpmp(szNatpmp);
-    stored.enWay = szUpnp != "yes" && szNatpmp != "yes" ? Way::kManual : WayOf(szUpnp, szNatpmp);
-    return stored;
-}
-
-constexpr char kDetect[] =
-    "\n  tavoportmap detect --save                  asks the router and remembers the answer"
-    "\n  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes"
-    "\n                                             says it yourself, when detection cannot";
-
-// Why a save without a status failed, as far as what is stored tells.
-std::string WhyFailed(const Stored& stored, const std::string& szGateway) {
-    const std::string szName = RouterName(stored.szBrand, stored.szModel, stored.szVersion);
-    if (!stored.blAny) {
-        return fmt::format("nothing is known of the router {} yet:{}", szGateway, kDetect);
-    }
-    if (!stored.blThisGateway) {
-        return fmt::format("what is stored is about another router than {}:{}", szGateway, kDetect);
-    }
-    int nMaxRules = -1;
-    if (stored.enWay == Way::kManual) {
-        return RouterDB(szGateway).GetRouterDesc()
-                   ? "the script that drives this router failed; the system log has the reason"
-                   : fmt::format(
-                         "there is no description of the router {}, which is driven through its own pages:"
-                         "\n  tavoportmap routers                        shows the models that are known"
-                         "\n  tavoportmap routers --update               fetches the newest descriptions"
-                         "\n  tavoportmap router set --brand ... --model ... --version ..."
-                         "\n                                             names one of them",
-                         szName);
-    }
-    if (!RouterUpnpDB(stored.szBrand, stored.szModel, stored.szVersion).GetMaxRule(nMaxRules)) {
-        return fmt::format(
-            "nobody has recorded how many rules the router {} holds:"
-            "\n  tavoportmap router set --max-rules 32      records it; 0 when no limit is known",
-            szName);
-    }
-    return "the port-mapping daemon could not be started or did not answer; the system log says which:"
-           "\n  journalctl -t tavoportmap -t upnpd -t natpmpd";
+// Why a save without a status failed, although nothing was in its way beforehand.
+std::string WhyFailed(const StoredRouter& router) {
+    return router.enWay == Way::kManual
+               ? "the script that drives this router failed; the system log has the reason"
+               : "the port-mapping daemon could not be started or did not answer; the system log says which:"
+                 "\n  journalctl -t tavoportmap -t upnpd -t natpmpd";
 }
 
 // Which ports the router refused, and what became of the others.
@@ -131,7 +80,7 @@ std::string WhyTooMany(const SaveResult& result, size_t nRules) {
     }
 }
 
-Reply Explain(const SaveResult& result, const std::string& szGateway, size_t nRules) {
+Reply Explain(const SaveResult& result, const StoredRouter& router, size_t nRules) {
     switch (result.nStatus) {
         case 2:
             return Busy();
@@ -148,27 +97,69 @@ Reply Explain(const SaveResult& result, const std::string& szGateway, size_t nRu
         }
         case 8:
         case 9: {
-            Reply reply{.enExit = kRefused, .szMessage = WhyRefused(result, ReadStored(szGateway).enWay)};
+            Reply reply{.enExit = kRefused, .szMessage = WhyRefused(result, router.enWay)};
             reply.jsAnswer["ports"] = result.szPortList;
             return reply;
         }
         default:
-            return Failure("the rules were not saved: " + WhyFailed(ReadStored(szGateway), szGateway));
+            return Failure("the rules were not saved: " + WhyFailed(router));
     }
 }
 
-Reply Saved(const std::string& szGateway, const Rules& rules) {
+Reply Saved(const std::string& szGateway, const StoredRouter& router, const Rules& rules) {
     const auto nOn = std::count_if(rules.begin(), rules.end(), [](const Rule& rule) { return rule.blEnabled; });
     const std::string szCount = nOn == 1 ? "1 rule" : fmt::format("{} rules", nOn);
     if (nOn == 0) {
         return {.szMessage = fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)};
     }
-    if (ReadStored(szGateway).enWay != Way::kManual) {
+    if (router.enWay != Way::kManual) {
         return {.szMessage = fmt::format("{} in force on the router {}", szCount, szGateway)};
     }
     return {.szMessage = fmt::format("{} handed to the router {}", szCount, szGateway),
             .rgszWarnings = {"a router that is driven through its own pages does not say what it took: look at them, "
                              "or try a connection from outside"}};
+}
+
+// What the library is not asked for, since it would switch the daemons off before it refuses.
+std::optional<Reply> Refused(const StoredRouter& router, const std::string& szGateway, const Rules& rules,
+                             SaveResult& result) {
+    if (const auto szWhy = WhyUnsavable(router, szGateway)) {
+        return Failure("the rules were not saved: " + *szWhy);
+    }
+    return Fits(router, szGateway, rules, result) ? std::nullopt : std::optional(Explain(result, router, rules.size()));
+}
+
+int CallLibrary(const std::string& szGateway, std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, bool blJson,
+                SaveResult& result) {
+    Progress progress(blJson);
+    return TLibSaveRules(
+        szGateway.c_str(), static_cast<int>(rgRecords.size()), rgRecords.data(), false, &result,
+        [](const SaveResult* pResult, void* pData) {
+            static_cast<Progress*>(pData)->Show(pResult->nProgress, StepAt(pResult->nProgress));
+        },
+        &progress);
+}
+
+Reply SaveRecords(const std::string& szGateway, const Rules& rules, std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords,
+                  bool blJson) {
+    SaveResult result = {};
+    const StoredRouter router = ReadStoredRouter();
+    Reply reply;
+    if (const auto refused = Refused(router, szGateway, rules, result)) {
+        reply = *refused;
+    } else {
+        KeysGuard keys;
+        if (keys.Obstacle()) {
+            return *keys.Obstacle();
+        }
+        const int nResult = CallLibrary(szGateway, rgRecords, blJson, result);
+        if (nResult == 0) {
+            keys.Keep();
+        }
+        reply = nResult == 0 ? Saved(szGateway, router, rules) : Explain(result, router, rules.size());
+    }
+    reply.jsAnswer["status"] = result.nStatus;
+    return reply;
 }
 
 Reply Save(bool blJson) {
@@ -187,17 +178,7 @@ Reply Save(bool blJson) {
     if (!rgRecords) {
         return Failure(rules ? "a value in /etc/portforward/rule.conf is longer than the library takes" : kUnreadable);
     }
-    SaveResult result = {};
-    Progress progress(blJson);
-    const int nResult = TLibSaveRules(
-        szGateway->c_str(), static_cast<int>(rgRecords->size()), rgRecords->data(), false, &result,
-        [](const SaveResult* pResult, void* pData) {
-            static_cast<Progress*>(pData)->Show(pResult->nProgress, StepAt(pResult->nProgress));
-        },
-        &progress);
-    progress.End();
-    Reply reply = nResult == 0 ? Saved(*szGateway, *rules) : Explain(result, *szGateway, rules->size());
-    reply.jsAnswer["status"] = result.nStatus;
+    Reply reply = SaveRecords(*szGateway, *rules, *rgRecords, blJson);
     reply.jsAnswer["rules"] = static_cast<Json::UInt>(rules->size());
     return reply;
 }

@@ -11,6 +11,7 @@
 #include "Capture.h"
 #include "Commands.h"
 #include "CompatTest.h"
+#include "KeysGuard.h"
 #include "Progress.h"
 #include "Reach.h"
 #include "ServicePlan.h"
@@ -56,6 +57,7 @@ struct Surroundings {
     Records rgStored = {};
     ServiceRouter router = {};
     ServicePlan plan = {};
+    bool blTooMany = false;
 };
 
 std::optional<UsedPorts> AskRouter() {
@@ -79,10 +81,11 @@ Reply ReadRequests(const Wish& wish, Requests& rgRequests) {
     return {};
 }
 
-// How many rules there would be is looked at when they are saved.
+// How many rules there would be is looked at when they are saved, and the daemons are switched off by then.
 void CheckCapacity(Surroundings& found) {
     const int nAfter = static_cast<int>(found.plan.after.size());
     if (found.plan.szRefusal.empty() && found.router.nMaxRules >= 1 && nAfter > found.router.nMaxRules) {
+        found.blTooMany = true;
         found.plan.szRefusal =
             fmt::format("the router holds {} rules and there would be {}", found.router.nMaxRules, nAfter);
     }
@@ -255,6 +258,13 @@ Reply Set(const Wish& wish, bool blJson) {
     if (const std::string szFault = Objection(wish, found); !szFault.empty() && !wish.blForce) {
         return {.enExit = kUsage, .szMessage = szFault};
     }
+    if (found.blTooMany) {
+        return {.enExit = kTooMany, .szMessage = "nothing was changed: " + found.plan.szRefusal};
+    }
+    KeysGuard keys(KeysGuard::Lock::kTakenByTheCall);
+    if (keys.Obstacle()) {
+        return *keys.Obstacle();
+    }
     Progress progress(blJson);
     progress.Show(0, "merging the request with the rules and writing them to the router");
     LogCapture log;
@@ -263,6 +273,9 @@ Reply Set(const Wish& wish, bool blJson) {
                                 static_cast<int>(found.rgRequests.size()), wish.blTest);
     const std::string szLog = log.Take();
     progress.End();
+    if (nResult == 0) {
+        keys.Keep();
+    }
     Reply reply = nResult == 0   ? SetDone(wish, found, szLog)
                   : nResult == 1 ? Failure(kNotDetected)
                   : nResult == 2 ? Busy()
@@ -304,6 +317,10 @@ Reply Detect(bool blJson) {
     }
     if (IsTesting()) {
         return AlreadyTesting();
+    }
+    KeysGuard keys(KeysGuard::Lock::kTakenByTheCall);
+    if (keys.Obstacle()) {
+        return *keys.Obstacle();
     }
     Progress progress(blJson);
     progress.Show(0, "asking the router what it is; a router that nobody knows is tested, which takes minutes");

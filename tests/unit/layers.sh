@@ -11,5 +11,5 @@ forbid() { # FOLDER PATTERN REASON
 }
 forbid src '(core|portforward|porttest|net|upnp|task|daemons)/' "the library knows the platform by its seam only"
 forbid platform 'libtavoportmap' "the platform stands beneath the library"
-forbid cli '(tavo|core|portforward|porttest|net|upnp|task|daemons)/' "callers use the public header only"
+forbid cli '(core|portforward|porttest|net|upnp|task|daemons)/' "callers use the public header and the seam only"
 forbid include 'tavo/' "the public header stands alone"

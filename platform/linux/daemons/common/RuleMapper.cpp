@@ -13,6 +13,7 @@
 #include "net/Neighbour.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
+#include "tavo/runkeys.h"
 
 namespace tavo {
 
@@ -41,6 +42,13 @@ RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
       mBlRequestRenews(blRequestRenews),
       mNCheckSeconds(Setting(names.szName, "check_interval", "120", 1, 3600)),
       mNWishedLease(static_cast<uint32_t>(Setting(names.szName, "lease", "3600", 20, 604800))) {}
+
+// Whether the run key has come back: a save or a detection that was killed leaves it off.
+bool RuleMapper::MendRunKeys() {
+    const bool blWasOn = IsSwitchedOn();
+    mBlMended = TAVORunKeysMend() == 0;
+    return !blWasOn && IsSwitchedOn();
+}
 
 void RuleMapper::ReadRules() {
     unlink(mNames.szResultFile);  // what it says belongs to an older request
@@ -119,6 +127,9 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
 }
 
 int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
+    if (!mBlMended) {
+        blRequested = MendRunKeys() || blRequested;
+    }
     if (blRequested) {
         ReadRules();
     }
@@ -147,6 +158,9 @@ int RuleMapper::SecondsToNext(const PassResult& result) {
         return std::min(mNCheckSeconds, kRetrySeconds);
     }
     mNFailures = 0;
+    if (!mBlMended) {
+        return std::min(mNCheckSeconds, kRetrySeconds);
+    }
     if (mNLease == 0) {
         return mNCheckSeconds;
     }

@@ -51,6 +51,7 @@ protected:
     uint32_t WishedLease() const { return mNWishedLease; }
 
 private:
+    bool MendRunKeys();
     void ReadRules();
     bool FindGateway();
     bool TakeTurn(const std::function<bool()>& fnStop);
@@ -68,6 +69,7 @@ private:
     uint32_t mNWishedLease;
     WantedSet mWanted;
     bool mBlRulesRead = false;
+    bool mBlMended = false;  // no killed save or detection has left our run key off
     RouterTurn mTurn;
     std::string mSzGateway;
     std::string mSzBox;

@@ -1,0 +1,109 @@
+// Looks before a save. Relies on the library's readers and databases. Promises: see StoredRouter.h.
+#include "StoredRouter.h"
+
+#include <fmt/format.h>
+
+namespace tavo::cli {
+
+namespace {
+
+enum SaveStatus : int { kTooManyRules = 7, kTooManyPorts = 10, kNoRangePage = 11, kTooManyRanges = 12 };
+
+constexpr char kDetect[] =
+    "\n  tavoportmap detect --save                  asks the router and remembers the answer"
+    "\n  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes"
+    "\n                                             says it yourself, when detection cannot";
+
+// Which limit of the pages is in the way, as the library reports it: by the limits alone.
+void ReportPages(RouterDB& db, int nMaxPort, int nMaxRange, SaveResult& result) {
+    bool blRangePage = false;
+    db.IsSupportPageRange(blRangePage);
+    result.nLimit = nMaxPort;
+    if (nMaxRange != 0 && nMaxPort > 0 && nMaxRange > 0) {
+        result.nStatus = kTooManyRanges;
+        result.nLimit2 = nMaxRange;
+    } else if (nMaxRange != 0) {
+        result.nStatus = kTooManyPorts;
+        result.nLimit = -1;
+    } else {
+        result.nStatus = blRangePage ? kNoRangePage : kTooManyPorts;
+    }
+}
+
+// A router that is driven through its pages holds so many single ports and so many ranges.
+bool FitsPages(const std::string& szGateway, const Rules& rules, SaveResult& result) {
+    RouterDB db(szGateway);
+    RouterRuleConfWriter writer;
+    for (const Rule& rule : rules) {
+        writer.AddRule(rule.szId, rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts, rule.szProtocol,
+                       rule.szServiceId, rule.szName);
+    }
+    int nMaxPort = 0, nMaxRange = 0, nPorts = 0, nRanges = 0;
+    if (!db.GetMaxPorts(nMaxPort) || !db.GetMaxRange(nMaxRange) || writer.GetPorts(nPorts, szGateway) == 0 ||
+        writer.GetRange(nRanges, szGateway) == 0 || (nMaxPort >= nPorts && nMaxRange >= nRanges)) {
+        return true;  // what cannot be counted is not what is in the way
+    }
+    ReportPages(db, nMaxPort, nMaxRange, result);
+    return false;
+}
+
+}  // namespace
+
+StoredRouter ReadStoredRouter() {
+    RouterConfReader reader;  // the section that saving goes by, whatever gateway it names
+    StoredRouter stored;
+    std::string szUpnp, szNatpmp;
+    stored.blAny = reader.GetSectionName(stored.szSection) != 0 && !stored.szSection.empty();
+    reader.GetBrand(stored.szBrand);
+    reader.GetModel(stored.szModel);
+    reader.GetVersion(stored.szVersion);
+    reader.GetSupportUpnp(szUpnp);
+    reader.GetSupportNatpmp(szNatpmp);
+    stored.enWay = szUpnp != "yes" && szNatpmp != "yes" ? Way::kManual : WayOf(szUpnp, szNatpmp);
+    return stored;
+}
+
+std::optional<std::string> WhyUnsavable(const StoredRouter& router, const std::string& szGateway) {
+    if (!router.blAny) {
+        return fmt::format("nothing is known of the router {} yet:{}", szGateway, kDetect);
+    }
+    if (router.szSection != szGateway) {
+        return fmt::format("what is stored is about another router ({}) than {}:{}", Clean(router.szSection), szGateway,
+                           kDetect);
+    }
+    int nMaxRules = -1;
+    if (router.enWay == Way::kManual) {
+        return RouterDB(szGateway).GetRouterDesc()
+                   ? std::nullopt
+                   : std::optional(
+                         fmt::format("there is no description of the router {}, which is driven through its own pages:"
+                                     "\n  tavoportmap routers                        shows the models that are known"
+                                     "\n  tavoportmap routers --update               fetches the newest descriptions"
+                                     "\n  tavoportmap router set --brand ... --model ... --version ..."
+                                     "\n                                             names one of them",
+                                     router.Name()));
+    }
+    if (!RouterUpnpDB(router.szBrand, router.szModel, router.szVersion).GetMaxRule(nMaxRules)) {
+        return fmt::format(
+            "nobody has recorded how many rules the router {} holds:"
+            "\n  tavoportmap router set --max-rules 32      records it; 0 when no limit is known",
+            router.Name());
+    }
+    return std::nullopt;
+}
+
+bool Fits(const StoredRouter& router, const std::string& szGateway, const Rules& rules, SaveResult& result) {
+    if (router.enWay == Way::kManual) {
+        return FitsPages(szGateway, rules, result);
+    }
+    int nMaxRules = 0;
+    const bool blKnown = RouterUpnpDB(router.szBrand, router.szModel, router.szVersion).GetMaxRule(nMaxRules);
+    if (!blKnown || nMaxRules < 1 || rules.size() <= static_cast<size_t>(nMaxRules)) {
+        return true;
+    }
+    result.nStatus = kTooManyRules;
+    result.nLimit = nMaxRules;
+    return false;
+}
+
+}  // namespace tavo::cli
