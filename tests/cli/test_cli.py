@@ -492,7 +492,7 @@ class Tool(unittest.TestCase):
         span = lambda: dice.choice(["{0}", "{0}-{1}", "{0},{2}"]).format(*sorted(dice.sample(range(20, 29), 3)))
         protocol = lambda: dice.choice(["tcp", "tcp", "udp", "all"])
         outcomes = {}
-        for turn in range(120):
+        for turn in range(60):
             put(ROUTER, KNOWN.replace("Acme", "Zeta") % (("yes", "no") if turn % 2 else ("no", "yes")))
             put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="0"\n')
             rules = []
@@ -515,7 +515,7 @@ class Tool(unittest.TestCase):
                 self.assertEqual((code, told["result"]), (REFUSED if out else OK, 0), case)
                 self.assertEqual(self.json("rules", "list")[1]["rules"], plan["rules_after"], case)
             outcomes[code] = outcomes.get(code, 0) + 1
-        self.assertGreater(min(outcomes[OK], outcomes[REFUSED], outcomes[FAILED]), 10, outcomes)
+        self.assertGreater(min(outcomes[OK], outcomes[REFUSED], outcomes[FAILED]), 5, outcomes)
 
     def test_answers_to_a_service(self):
         world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:9", "TAVO_SAVE": "0 write", "TAVO_REACH": "2 0 NOLISTEN"}
