@@ -50,7 +50,8 @@ def get(path):
 
 def describe(brand, model, version):
     os.makedirs(f"{MODELS}/{brand}/{model}/{version}", exist_ok=True)
-    put(f"{MODELS}/{brand}/{model}/{version}/router.des", '[global]\nsyntax version="1"\n')
+    put(f"{MODELS}/{brand}/{model}/{version}/router.des",
+        '[global]\nsyntax version="1"\n[PF port page]\ntcp="yes"\nudp="yes"\nchange router port="yes"\nmax rule="4"\n')
 
 
 def on_terminal(*arguments, typed=b"", **environment):
