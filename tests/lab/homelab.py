@@ -140,7 +140,8 @@ class Lab:
         for directory in ("/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/sbin",
                           "/usr/tavo/bin", "/etc/tavo"):
             os.makedirs(directory, exist_ok=True)
-        for program in (*(f"sbin/{daemon}" for daemon in DAEMONS), "sbin/tavoairportd", "bin/tavoportforward"):
+        for program in (*(f"sbin/{daemon}" for daemon in DAEMONS), "sbin/tavoairportd", "bin/tavoportforward",
+                        "bin/tavohook"):
             if os.path.lexists(f"/usr/tavo/{program}"):
                 os.unlink(f"/usr/tavo/{program}")
             os.symlink(f"{BUILD}/platform/linux/daemons/{os.path.basename(program)}", f"/usr/tavo/{program}")

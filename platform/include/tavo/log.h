@@ -9,7 +9,16 @@ extern "C" {
 
 enum { /* events of TAVOLogSet1 */
        TAVO_EVENT_PF_ADD_FAILED = 0x13100020,
-       TAVO_EVENT_PF_CONFLICT = 0x13100022
+       TAVO_EVENT_PF_CONFLICT = 0x13100022,
+       /* what changed behind the box's back, as the daemons tell it */
+       TAVO_EVENT_PF_PORT_LOST = 0x13100030,
+       TAVO_EVENT_PF_PORT_REFUSED = 0x13100031,
+       TAVO_EVENT_PF_PORT_BACK = 0x13100032,
+       TAVO_EVENT_PF_ROUTER_GONE = 0x13100033,
+       TAVO_EVENT_PF_ROUTER_BACK = 0x13100034,
+       TAVO_EVENT_PF_ROUTER_REPLACED = 0x13100035,
+       TAVO_EVENT_PF_ADDRESS_CHANGED = 0x13100036,
+       TAVO_EVENT_PF_RENEWED = 0x13100037
 };
 
 /* Appends one event to /var/log/tavo/event.log: time, level (1 information, 2 warning, 3 error), event

@@ -7,6 +7,7 @@
 
 #include "core/Border.h"
 #include "core/TextFile.h"
+#include "log/Catalogue.h"
 #include "log/LogFile.h"
 #include "tavo/log.h"
 
@@ -34,19 +35,32 @@ const char* LevelName(int nLevel) {
     }
 }
 
-// The catalogue: a message, and the place where the first text goes at its end.
-const char* Message(unsigned nEvent) {
-    switch (nEvent) {
-        case TAVO_EVENT_PF_CONFLICT:
-            return "The router already uses these ports for something else: ";
-        case TAVO_EVENT_PF_ADD_FAILED:
-            return "The router refused to forward these ports: ";
-        default:
-            return "Event: ";
-    }
-}
+constexpr std::pair<unsigned, const char*> kCatalogue[] = {
+    {TAVO_EVENT_PF_CONFLICT, "The router already uses these ports for something else: "},
+    {TAVO_EVENT_PF_ADD_FAILED, "The router refused to forward these ports: "},
+    {TAVO_EVENT_PF_PORT_LOST, "Lost on the router: "},
+    {TAVO_EVENT_PF_PORT_REFUSED, "Refused by the router: "},
+    {TAVO_EVENT_PF_PORT_BACK, "Open on the router again: "},
+    {TAVO_EVENT_PF_ROUTER_GONE, "The router is gone: "},
+    {TAVO_EVENT_PF_ROUTER_BACK, "The router is back: "},
+    {TAVO_EVENT_PF_ROUTER_REPLACED, "The router is another one: "},
+    {TAVO_EVENT_PF_ADDRESS_CHANGED, "The outside address has changed: "},
+    {TAVO_EVENT_PF_RENEWED, "The router had lost these ports, and has them again: "}};
 
 }  // namespace
+
+namespace tavo {
+
+const char* EventMessage(unsigned nEvent) {
+    for (const auto& [nKnown, szMessage] : kCatalogue) {
+        if (nKnown == nEvent) {
+            return szMessage;
+        }
+    }
+    return "Event: ";
+}
+
+}  // namespace tavo
 
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4) {
@@ -56,7 +70,8 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
         }
         char szEvent[16];
         std::snprintf(szEvent, sizeof(szEvent), "0x%08X", nEvent);
-        std::string szLine = tavo::LogTime() + " " + LevelName(nLevel) + " " + szEvent + " " + Message(nEvent);
+        std::string szLine =
+            tavo::LogTime() + " " + LevelName(nLevel) + " " + szEvent + " " + tavo::EventMessage(nEvent);
         for (const char* szText : {szText1, szText2, szText3, szText4}) {
             if (szText != nullptr && *szText != '\0') {
                 szLine += (szLine.ends_with(": ") ? "" : " ") + tavo::PrintableText(szText, kTextSize);

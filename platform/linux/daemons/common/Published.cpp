@@ -6,8 +6,6 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <algorithm>
-
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -44,14 +42,11 @@ Json::Value HolderOf(const Verdict& verdict) {
 }
 
 Json::Value RuleRow(const Outcome& outcome, time_t nAt) {
-    std::string szProtocol = outcome.szProtocol;
-    std::transform(szProtocol.begin(), szProtocol.end(), szProtocol.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
     Json::Value js;
     js["name"] = outcome.szName;
     js["router_port"] = NumberOrNull(outcome.nRouterPort);
     js["box_port"] = NumberOrNull(outcome.nBoxPort);
-    js["protocol"] = TextOrNull(szProtocol);
+    js["protocol"] = TextOrNull(ProtocolWord(outcome));
     js["rule"] = TextOrNull(outcome.szRule);
     js["state"] = PortWord(outcome.verdict.enState);
     js["word"] = outcome.verdict.szWord;
@@ -86,6 +81,10 @@ std::string PortWord(PortState enState) {
     }
 }
 
+std::string ProtocolWord(const Outcome& outcome) {
+    return outcome.szProtocol == "TCP" ? "tcp" : outcome.szProtocol == "UDP" ? "udp" : "";
+}
+
 std::string RouterWord(const Published& state) {
     switch (state.enRouter) {
         case RouterState::kOk:
@@ -102,19 +101,6 @@ std::string RouterWord(const Published& state) {
             return "busy";
         default:
             return "";
-    }
-}
-
-void NoteSince(const Published& before, Published& state) {
-    const bool blSame = before.enRouter == state.enRouter && before.szGateway == state.szGateway;
-    state.nRouterSince = blSame && before.nRouterSince != 0 ? before.nRouterSince : state.nAt;
-    for (Outcome& outcome : state.rgOutcomes) {
-        const auto it = std::find_if(before.rgOutcomes.begin(), before.rgOutcomes.end(), [&](const Outcome& old) {
-            return old.szName == outcome.szName && old.blLeftOver == outcome.blLeftOver &&
-                   old.nBoxPort == outcome.nBoxPort && old.verdict.enState == outcome.verdict.enState &&
-                   old.verdict.szWord == outcome.verdict.szWord;
-        });
-        outcome.nSince = it == before.rgOutcomes.end() ? state.nAt : it->nSince;
     }
 }
 

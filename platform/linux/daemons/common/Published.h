@@ -30,9 +30,8 @@ struct Published {
 // "ok", "silent" and so on; empty when the router was not asked.
 std::string RouterWord(const Published& state);
 std::string PortWord(PortState enState);
-
-// Since when things are as they are: what is as it was before keeps its time.
-void NoteSince(const Published& before, Published& state);
+// "tcp", "udp"; empty where a rule has no single one.
+std::string ProtocolWord(const Outcome& outcome);
 
 std::string ToJson(const Published& state);
 // A failure is logged.

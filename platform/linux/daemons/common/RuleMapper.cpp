@@ -41,7 +41,8 @@ RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
     : mNames(names),
       mBlRequestRenews(blRequestRenews),
       mNCheckSeconds(Setting(names.szName, "check_interval", "120", 1, 3600)),
-      mNWishedLease(static_cast<uint32_t>(Setting(names.szName, "lease", "3600", 20, 604800))) {}
+      mNWishedLease(static_cast<uint32_t>(Setting(names.szName, "lease", "3600", 20, 604800))),
+      mTold(names.szName) {}
 
 // Whether the run key has come back: a save or a detection that was killed leaves it off.
 bool RuleMapper::MendRunKeys() {
@@ -58,6 +59,7 @@ void RuleMapper::ReadRules() {
         mBlRulesRead = true;
     } else {
         mWanted.blReadable = false;
+        mWanted.blSwitchedOn = wanted.blSwitchedOn;
         syslog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
     }
 }
@@ -143,7 +145,7 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
     }
     const int nSeconds = SecondsToNext(result);
     if (!result.blStopped) {
-        PublishPass(std::move(result), nSeconds, fnStop);
+        PublishPass(std::move(result), blRequested, nSeconds, fnStop);
     }
     return nSeconds;
 }
@@ -213,7 +215,8 @@ void RuleMapper::AskOutside(const std::function<bool()>& fnStop) {
     }
 }
 
-void RuleMapper::PublishPass(PassResult result, int nSecondsToNext, const std::function<bool()>& fnStop) {
+void RuleMapper::PublishPass(PassResult result, bool blRequested, int nSecondsToNext,
+                             const std::function<bool()>& fnStop) {
     Published state{mNames.szName, mNames.szProtocol};
     state.blSwitchedOn = IsSwitchedOn();
     state.blRulesReadable = mWanted.blReadable;
@@ -230,9 +233,20 @@ void RuleMapper::PublishPass(PassResult result, int nSecondsToNext, const std::f
     state.szOutside = mSzOutside;
     state.nAt = std::time(nullptr);
     state.nNextLook = state.nAt + nSecondsToNext;
-    NoteSince(mPublished, state);
+    NoteSince(mTold.mTold, state);
     Publish(state);
-    mPublished = std::move(state);
+    TellNews(state, blRequested);
+}
+
+void RuleMapper::TellNews(const Published& state, bool blRequested) {
+    if (!mWanted.blSwitchedOn) {
+        mTold.mTold = Told();         // whoever maps now tells what there is to tell
+    } else if (state.blSwitchedOn) {  // a save switches it off for a moment
+        for (const Notice& notice : Compare(mTold.mTold, state, blRequested)) {
+            mTeller.Tell(notice, state);
+        }
+    }
+    mTold.Save();
 }
 
 void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
@@ -243,6 +257,8 @@ void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = Map({}, false, fnStop);
         if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
+            mTold.mTold.blWithdrawn = true;
+            mTold.Save();
             return;
         }
     }

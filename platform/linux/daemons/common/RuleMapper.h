@@ -2,7 +2,8 @@
 // clock of checks, renewals and retries. Relies on the settings, the rule file and the platform's addresses;
 // the protocol is spoken by the class derived from it.
 // Promises: the result file is removed when a request begins and complete when its pass has ended; what is known
-// is published after each pass; the router is spoken to only while the other daemon does not.
+// is published after each pass, and what has changed is told; the router is spoken to only while the other daemon does
+// not.
 #pragma once
 
 #include <functional>
@@ -15,6 +16,8 @@
 #include "daemons/common/Published.h"
 #include "daemons/common/Reconcile.h"
 #include "daemons/common/RouterTurn.h"
+#include "daemons/common/Teller.h"
+#include "daemons/common/ToldFile.h"
 #include "daemons/common/Wanted.h"
 
 namespace tavo {
@@ -61,7 +64,8 @@ private:
     int SecondsToNext(const PassResult& result);
     void LookAtRouter(Published& state, const std::function<bool()>& fnStop);
     void AskOutside(const std::function<bool()>& fnStop);
-    void PublishPass(PassResult result, int nSecondsToNext, const std::function<bool()>& fnStop);
+    void PublishPass(PassResult result, bool blRequested, int nSecondsToNext, const std::function<bool()>& fnStop);
+    void TellNews(const Published& state, bool blRequested);
 
     const DaemonNames& mNames;
     bool mBlRequestRenews;
@@ -78,7 +82,8 @@ private:
     BootClock::time_point mRenewed;
     std::string mSzOutside;
     int mNUntilOutside = 0;  // passes until the router is asked for it again
-    Published mPublished;    // as of the last pass
+    ToldFile mTold;
+    Teller mTeller;
 };
 
 }  // namespace tavo

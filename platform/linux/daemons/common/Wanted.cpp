@@ -91,6 +91,7 @@ WantedSet ReadWanted(const char* szRunKey) {
     if (!IsRunKeyOn(szRunKey)) {
         return wanted;
     }
+    wanted.blSwitchedOn = true;
     const ConfList pRules(TAVOPFRuleGet());
     wanted.blReadable = pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCErrGet() == TLIBC_ERR_NOT_FOUND;
     std::map<std::string, uint16_t> mapBoxPorts;

@@ -20,6 +20,7 @@ struct WantedSet {
     OutcomeList rgRefused;
     std::map<std::string, std::string> mapRules;  // which rule asked for a mapping, by the mapping's name
     bool blReadable = true;
+    bool blSwitchedOn = false;  // else nothing is wanted, whatever the rules say
 };
 
 // Whether szRunKey of the system settings is "yes".

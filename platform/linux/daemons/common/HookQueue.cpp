@@ -1,0 +1,105 @@
+// A runner of hooks, started when there is something to run. Relies on posix_spawn and a local socket that keeps
+// messages apart. Promises: see HookQueue.h.
+#include "daemons/common/HookQueue.h"
+
+#include <signal.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <syslog.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "core/Directory.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr char kRunner[] = "/usr/tavo/bin/tavohook";
+constexpr int kQueueBytes = 32768;  // what waits for a slow hook is bounded
+
+class RunnerSetup {
+public:
+    explicit RunnerSetup(int fdFacts) {
+        posix_spawn_file_actions_init(&mActions);
+        posix_spawn_file_actions_adddup2(&mActions, fdFacts, STDIN_FILENO);
+        posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
+        posix_spawnattr_init(&mAttributes);
+        sigset_t all;
+        sigset_t none;
+        sigfillset(&all);
+        sigemptyset(&none);
+        posix_spawnattr_setsigdefault(&mAttributes, &all);
+        posix_spawnattr_setsigmask(&mAttributes, &none);
+        posix_spawnattr_setflags(&mAttributes, POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSID);
+    }
+    ~RunnerSetup() {
+        posix_spawn_file_actions_destroy(&mActions);
+        posix_spawnattr_destroy(&mAttributes);
+    }
+    RunnerSetup(const RunnerSetup&) = delete;
+    RunnerSetup& operator=(const RunnerSetup&) = delete;
+
+    // The system's word for it; 0: *pPid is the runner.
+    int Spawn(pid_t* pPid) const {
+        char szName[] = "tavohook";
+        char szFollow[] = "--follow";
+        char* const rgszArguments[] = {szName, szFollow, nullptr};
+        char* const rgszEnvironment[] = {nullptr};
+        return posix_spawn(pPid, kRunner, &mActions, &mAttributes, rgszArguments, rgszEnvironment);
+    }
+
+private:
+    posix_spawn_file_actions_t mActions;
+    posix_spawnattr_t mAttributes;
+};
+
+}  // namespace
+
+HookQueue::~HookQueue() {
+    mFdFacts.Reset();  // the runner ends with what it has
+}
+
+bool HookQueue::Start() {
+    int rgFd[2];
+    if (socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, rgFd) != 0) {
+        return false;
+    }
+    mFdFacts.Reset(rgFd[0]);
+    const Descriptor fdRunner(rgFd[1]);
+    setsockopt(mFdFacts.Get(), SOL_SOCKET, SO_SNDBUF, &kQueueBytes, sizeof(kQueueBytes));
+    const int nErrno = RunnerSetup(fdRunner.Get()).Spawn(&mPid);
+    if (nErrno != 0) {
+        mPid = -1;
+        mFdFacts.Reset();
+        syslog(LOG_ERR, "cannot run %s: %s", kRunner, std::strerror(nErrno));
+    }
+    return nErrno == 0;
+}
+
+bool HookQueue::Send(const std::string& szFacts) {
+    return mFdFacts.Get() >= 0 &&
+           send(mFdFacts.Get(), szFacts.data(), szFacts.size(), MSG_DONTWAIT | MSG_NOSIGNAL) >= 0;
+}
+
+void HookQueue::Run(const std::vector<std::string>& rgFacts) {
+    if (mPid > 0 && waitpid(mPid, nullptr, WNOHANG) == mPid) {
+        mPid = -1;
+        mFdFacts.Reset();
+    }
+    if (mPid < 0 && NamesIn(kHookDirectory).value_or(std::vector<std::string>()).empty()) {
+        return;
+    }
+    std::string szFacts;
+    for (const std::string& szFact : rgFacts) {
+        szFacts += szFact + '\0';
+    }
+    if (szFacts.size() > kMaxHookFacts || (mPid < 0 && !Start()) || !Send(szFacts)) {
+        syslog(LOG_WARNING, "a notice was not passed on to the hooks in %s", kHookDirectory);
+    }
+}
+
+}  // namespace tavo

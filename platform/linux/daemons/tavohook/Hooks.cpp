@@ -1,0 +1,183 @@
+// Finds and runs hooks. Relies on process descriptors, to wait for a child and its output at once.
+// Promises: see Hooks.h.
+#include "daemons/tavohook/Hooks.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+
+extern "C" {  // this header leaves it out
+#include <sys/pidfd.h>
+}
+
+#include "core/Descriptor.h"
+#include "core/Directory.h"
+#include "daemons/common/Outcome.h"
+
+namespace tavo {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+constexpr char kPath[] = "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
+constexpr size_t kMostHooks = 64;
+constexpr size_t kMostOutput = 300;
+constexpr auto kKillAfter = std::chrono::seconds(2);  // between the polite signal and the other one
+constexpr int kNotRun = 127;
+constexpr int kSignalled = 128;
+
+bool IsHookName(const std::string& szName) {
+    return !szName.empty() && std::all_of(szName.begin(), szName.end(), [](char c) {
+        return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_' || c == '-';
+    });
+}
+
+bool IsRootsAlone(const struct stat& status) {
+    return status.st_uid == 0 && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+}
+
+// Why a file is not run; null when it is. The path can be used after that: only root can put another file there.
+const char* Objection(int fdDirectory, const std::string& szName) {
+    const Descriptor fd(openat(fdDirectory, szName.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    struct stat status = {};
+    if (fd.Get() < 0 || fstat(fd.Get(), &status) != 0) {
+        return errno == ELOOP ? "it is a link" : "it cannot be opened";
+    }
+    if (!S_ISREG(status.st_mode)) {
+        return "it is no plain file";
+    }
+    if (!IsRootsAlone(status)) {
+        return "others than root may change it";
+    }
+    return (status.st_mode & S_IXUSR) == 0 ? "it is not executable" : nullptr;
+}
+
+// In the child: a process group of its own, nothing open but its output, no shell.
+[[noreturn]] void BecomeHook(const std::string& szPath, char* const* rgszEnvironment, int fdOutput) {
+    setpgid(0, 0);
+    for (int nSignal = 1; nSignal < NSIG; ++nSignal) {
+        signal(nSignal, SIG_DFL);
+    }
+    const int fdNull = open("/dev/null", O_RDONLY);
+    dup2(fdNull, STDIN_FILENO);
+    dup2(fdOutput, STDOUT_FILENO);
+    dup2(fdOutput, STDERR_FILENO);
+    closefrom(STDERR_FILENO + 1);
+    char* const rgszArguments[] = {const_cast<char*>(szPath.c_str()), nullptr};
+    if (chdir("/") == 0) {
+        execve(szPath.c_str(), rgszArguments, rgszEnvironment);
+    }
+    _exit(kNotRun);
+}
+
+// Takes what the hook says, as long as it is not too much; the rest is read and dropped.
+void TakeOutput(int fd, std::string& szOutput) {
+    std::array<char, 4096> rgBytes;
+    ssize_t nRead = 0;
+    while ((nRead = read(fd, rgBytes.data(), rgBytes.size())) > 0) {
+        szOutput.append(rgBytes.data(), std::min(static_cast<size_t>(nRead), kMostOutput - szOutput.size()));
+    }
+}
+
+// Whether the child has ended by then. What it says is taken in the meantime.
+bool WaitUntil(int fdProcess, int fdOutput, Clock::time_point end, std::string& szOutput) {
+    bool blEnded = false;
+    while (!blEnded && Clock::now() < end) {
+        const auto nLeft = std::chrono::ceil<std::chrono::milliseconds>(end - Clock::now()).count();
+        pollfd rgWaiting[] = {{fdProcess, POLLIN, 0}, {fdOutput, POLLIN, 0}};
+        poll(rgWaiting, std::size(rgWaiting), static_cast<int>(nLeft));
+        blEnded = rgWaiting[0].revents != 0;
+        if (rgWaiting[1].revents != 0) {
+            TakeOutput(fdOutput, szOutput);
+        }
+        if ((rgWaiting[1].revents & (POLLHUP | POLLERR)) != 0) {
+            fdOutput = -1;  // nobody is there to say anything; poll passes over it
+        }
+    }
+    return blEnded;
+}
+
+std::string OneLine(std::string szText) {
+    std::replace(szText.begin(), szText.end(), '\n', ' ');
+    return HarmlessText(szText, kMostOutput);
+}
+
+}  // namespace
+
+std::vector<std::string> FindHooks(const std::string& szDirectory, std::vector<std::string>& rgszRefused) {
+    const Descriptor fd(open(szDirectory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    struct stat status = {};
+    if (fd.Get() < 0 || fstat(fd.Get(), &status) != 0) {
+        return {};
+    }
+    if (!IsRootsAlone(status)) {
+        rgszRefused.push_back(szDirectory + ": others than root may change it");
+        return {};
+    }
+    std::vector<std::string> rgszHooks;
+    for (const std::string& szName : NamesIn(szDirectory).value_or(std::vector<std::string>())) {
+        if (!IsHookName(szName)) {
+            continue;
+        }
+        const char* szWhy = rgszHooks.size() >= kMostHooks ? "there are too many" : Objection(fd.Get(), szName);
+        if (szWhy == nullptr) {
+            rgszHooks.push_back(szName);
+        } else {
+            rgszRefused.push_back(szDirectory + "/" + szName + ": " + szWhy);
+        }
+    }
+    std::sort(rgszHooks.begin(), rgszHooks.end());
+    return rgszHooks;
+}
+
+HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFacts, std::chrono::milliseconds limit) {
+    std::vector<char*> rgszEnvironment = {const_cast<char*>(kPath)};
+    for (const std::string& szFact : rgFacts) {
+        rgszEnvironment.push_back(const_cast<char*>(szFact.c_str()));
+    }
+    rgszEnvironment.push_back(nullptr);
+    HookEnd end;
+    int rgFd[2];
+    if (pipe2(rgFd, O_CLOEXEC | O_NONBLOCK) != 0) {
+        return end;
+    }
+    const Descriptor fdRead(rgFd[0]);
+    Descriptor fdWrite(rgFd[1]);
+    fcntl(fdWrite.Get(), F_SETFL, 0);  // the hook's end is an ordinary one
+    const pid_t pid = fork();
+    if (pid == 0) {
+        BecomeHook(szPath, rgszEnvironment.data(), fdWrite.Get());
+    }
+    fdWrite.Reset();
+    const Descriptor fdProcess(pid < 0 ? -1 : pidfd_open(pid, 0));
+    if (fdProcess.Get() < 0) {
+        if (pid > 0) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+        return end;
+    }
+    end.blStarted = true;
+    std::string szOutput;
+    end.blInTime = WaitUntil(fdProcess.Get(), fdRead.Get(), Clock::now() + limit, szOutput);
+    if (!end.blInTime) {
+        kill(-pid, SIGTERM);
+        WaitUntil(fdProcess.Get(), fdRead.Get(), Clock::now() + kKillAfter, szOutput);
+        kill(-pid, SIGKILL);  // also who of its group is left
+    }
+    int nStatus = 0;
+    waitpid(pid, &nStatus, 0);
+    end.nStatus = WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : kSignalled + WTERMSIG(nStatus);
+    end.szOutput = OneLine(std::move(szOutput));
+    return end;
+}
+
+}  // namespace tavo
