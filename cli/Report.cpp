@@ -13,6 +13,7 @@
 #include "Commands.h"
 #include "Usage.h"
 #include "Verdict.h"
+#include "tavo/upnptest.h"
 
 namespace tavo::cli {
 
@@ -67,9 +68,11 @@ std::string WhyNotMade() {
 
 // Why an archive that was made was not sent.
 std::string WhyNotSent(const std::string& szMissing, const std::string& szArchive) {
+    const bool blServer = *GetUPnPReportServer() != '\0';
     const std::string szCause =
-        szMissing.empty() ? "the server, which is named in [report] of /etc/tavo/platform.conf, did not take it"
-                          : fmt::format("the last test did not leave {}; 'tavoportmap compat' runs one", szMissing);
+        !szMissing.empty() ? fmt::format("the last test did not leave {}; 'tavoportmap compat' runs one", szMissing)
+        : blServer         ? "the server, which is named in [report] of /etc/tavo/platform.conf, did not take it"
+                           : "no server is named to send it to (server in [report] of /etc/tavo/platform.conf)";
     return fmt::format("{}. What there is stays in {}", szCause, Clean(szArchive));
 }
 

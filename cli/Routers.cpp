@@ -7,6 +7,7 @@
 
 #include "Box.h"
 #include "Commands.h"
+#include "tavo/portforward.h"
 
 namespace tavo::cli {
 
@@ -62,21 +63,35 @@ Reply List(const std::vector<std::string>& rgszWords) {
     if (!reply.szBody.empty()) {
         reply.szBody = Paint(Ink::kBold, TableRow("brand", "model", "version"), STDOUT_FILENO) + reply.szBody;
     } else if (nModels == 0) {
-        reply.szMessage = "no router descriptions are installed; 'tavoportmap routers --update' fetches them";
+        reply.szMessage =
+            "no router descriptions are installed. Your own go to /etc/tavo/routerdb; 'tavoportmap routers --update' "
+            "fetches those of the server that database_url in /etc/tavo/platform.conf names";
     } else {
         reply.szMessage = fmt::format("none of the {} known routers matches; try a shorter word", nModels);
     }
     return reply;
 }
 
+// What a refresh says: an error, the version, or why there was nothing to do.
+Reply Update(int& nVersion) {
+    if (*GetRouterDBPath() == '\0') {
+        return Failure(
+            "no server is named to fetch router descriptions from (database_url in /etc/tavo/platform.conf); "
+            "'tavoportmap routers' lists those of this box");
+    }
+    if (TLibUpdateRouterDBList(&nVersion) == 1) {
+        return {};
+    }
+    return Failure(fmt::format("the router descriptions could not be updated, and the old ones stay: {}",
+                               *TAVOPFRouterDBWhy() == '\0' ? "the system log says why" : TAVOPFRouterDBWhy()));
+}
+
 Reply Routers(const Wish& wish) {
     Json::Value jsVersion;
     if (wish.blUpdate) {
         int nVersion = -1;
-        if (TLibUpdateRouterDBList(&nVersion) != 1) {
-            return Failure(
-                "the router descriptions could not be updated; the ones that were there still are. The server is "
-                "database_url in /etc/tavo/platform.conf; the system log says what went wrong");
+        if (Reply updated = Update(nVersion); updated.enExit != kOk) {
+            return updated;
         }
         jsVersion = nVersion;
     }

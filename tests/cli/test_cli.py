@@ -39,6 +39,7 @@ def tool(*arguments, stdin="", **environment):
 
 
 def put(path, text):
+    os.makedirs(os.path.dirname(path), exist_ok=True)
     with open(path, "w", encoding="utf-8") as file:
         file.write(text)
 
@@ -564,13 +565,27 @@ class Tool(unittest.TestCase):
 
     def test_models(self):
         os.makedirs(MODELS)
-        self.expect("routers", OK, "no router descriptions are installed; 'tavoportmap routers --update'")
+        self.expect("routers", OK, "no router descriptions are installed.*database_url")
+        self.expect("routers --update", FAILED, "no server is named")
         for brand, model, version in (("Acme", "R1", "1.0"), ("Acme", "R2 Plus", "2.0"), ("Zeta", "Z", "1")):
             describe(brand, model, version)
         for search, models in (((), ["R1", "R2 Plus", "Z"]), (("ACME",), ["R1", "R2 Plus"]), (("plus", "acme"), ["R2 Plus"])):
             self.assertEqual([router["model"] for router in self.json("routers", *search)[1]["routers"]], models)
         self.expect("routers nothere", OK, "none of the 3 known routers matches")
-        self.expect("routers --update", FAILED, "could not be updated; the ones that were there still are")
+        put("/etc/tavo/platform.conf", '[download]\ndatabase_url="http://127.0.0.1:1"\n[other]\n[download]\n')
+        self.expect("routers --update", FAILED, "could not be updated, and the old ones stay: \\S")
+        os.unlink("/etc/tavo/platform.conf")
+
+    def test_models_of_the_owner(self):
+        own = "/etc/tavo/routerdb"
+        for path, text in (("Acme/R1/1.0/router.des", "mine"), ("Mine/M/generic", 'version="7"\n'), ("Mine/M/7/router.des", "")):
+            put(f"{own}/{path}", text)
+        describe("Acme", "R1", "1.0")
+        known = lambda: [(m["brand"], m["version"], m["generic"]) for m in self.json("routers")[1]["routers"]]
+        self.assertEqual(known(), [("Acme", "1.0", False), ("Mine", "7", True), ("Mine", "7", False)])
+        self.assertEqual(get(f"{MODELS}/Mine/M/7/router.des"), "", "where the library looks")
+        shutil.rmtree(own)
+        self.assertEqual(known(), [("Acme", "1.0", False)])
 
 
 if __name__ == "__main__":

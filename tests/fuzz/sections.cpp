@@ -64,15 +64,13 @@ Sections Invented(const std::string& szText) {
     return rgSections;
 }
 
-// The first of two sections counts, and the last of two keys.
+// Two sections of one name are one, and the last of two keys counts.
 std::map<std::string, std::map<std::string, std::string>> Plain(const Sections& rgSections) {
     std::map<std::string, std::map<std::string, std::string>> mapPlain;
     for (const tavo::Section& section : rgSections) {
-        const auto [it, blNew] = mapPlain.try_emplace(section.szName);
+        auto& mapPairs = mapPlain[section.szName];
         for (const tavo::Pair& pair : section.rgPairs) {
-            if (blNew) {
-                it->second[pair.szKey] = pair.szValue;
-            }
+            mapPairs[pair.szKey] = pair.szValue;
         }
     }
     return mapPlain;

@@ -12,7 +12,7 @@ from homelab import BUILD, HERE, WAN, run_tests, wait_for
 
 LAB = None
 SERVED = "/tmp/served"
-ROUTERDB = "/etc.defaults/portforward/routerdb"
+ROUTERDB, OWN = "/etc.defaults/portforward/routerdb", "/etc/tavo/routerdb"
 UPNP, VERSION = "/etc/portforward/router_upnp.db", "/etc/portforward/routersdk_version"
 SCRIPTS = f"{HERE}/../../scripts"
 
@@ -27,6 +27,11 @@ def update(what):
 
 def update_models():
     return update("TLibUpdateRouterDBList")
+
+
+def update_in_words():
+    out = LAB.run("box", f"{BUILD}/cli/tavoportmap routers --update", check=False)
+    return out.stdout + out.stderr
 
 
 def update_upnp():
@@ -52,7 +57,7 @@ def archive(*members):
 class Downloads(unittest.TestCase):
     def setUp(self):
         LAB.install()
-        for directory in (SERVED, ROUTERDB):
+        for directory in (SERVED, ROUTERDB, OWN):
             shutil.rmtree(directory, ignore_errors=True)
         shutil.copytree(f"{HERE}/../../packaging/routerdb", "/tmp/edition", dirs_exist_ok=True)
         LAB.write("/tmp/edition/version", 'version="41"\n')
@@ -64,8 +69,14 @@ class Downloads(unittest.TestCase):
         shutil.copy(f"{HERE}/../../packaging/wget", "/usr/tavo/bin/wget")
         self.old = tree(ROUTERDB), tree("/etc/portforward")
 
-    def serve_from(self, fault):
-        LAB.write("/etc/tavo/platform.conf", f'[download]\ndatabase_url="http://{WAN}:8000/{fault}"\n')
+    def serve_from(self, fault, port=8000):
+        LAB.write("/etc/tavo/platform.conf", f'[download]\ndatabase_url="http://{WAN}:{port}/{fault}"\n')
+
+    def pack(self, version, syntax=1):
+        """An edition with one model, served."""
+        with open(f"{SERVED}/routerdb.tgz", "wb") as file:
+            file.write(archive(("version", f'version="{version}"\n'.encode(), tarfile.REGTYPE, ""), (
+                "A/B/1/router.des", f'[global]\nsyntax version="{syntax}"\n'.encode(), tarfile.REGTYPE, "")))
 
     def unchanged(self, *but):
         left = [{k: v for k, v in files.items() if k not in but} for files in (tree(ROUTERDB), tree("/etc/portforward"))]
@@ -86,17 +97,51 @@ class Downloads(unittest.TestCase):
         self.assertEqual(update_upnp(), (1, 2))
         self.unchanged("/routersdk_version")
 
+    def test_editions_that_the_box_cannot_use(self):
+        self.serve_from("good")
+        for version, syntax, why in ((4, 2, "needs syntax version 2"), (2, 1, "edition 2 is older than the installed 3")):
+            self.pack(version, syntax)
+            self.assertIn(why, update_in_words())
+            self.unchanged()
+
+    def test_what_the_owner_wrote_survives_a_refresh(self):
+        os.makedirs(f"{OWN}/Mine/M/1")
+        os.makedirs(f"{OWN}/A/B/1")
+        for model, text in (("Mine/M", "[a]\n"), ("A/B", "[mine]\n")):
+            LAB.write(f"{OWN}/{model}/1/router.des", text)
+        self.pack(4)
+        self.serve_from("good")
+        self.assertIn("version 4", update_in_words())
+        self.assertEqual(LAB.read(f"{ROUTERDB}/Mine/M/1/router.des"), "[a]\n")
+        self.assertEqual([LAB.read(f"{place}/A/B/1/router.des") for place in (OWN, ROUTERDB)],
+                         ["[mine]\n", '[global]\nsyntax version="1"\n'])
+
+    def test_no_server_is_no_attempt(self):
+        LAB.write("/etc/tavo/platform.conf", "")
+        os.unlink(UPNP)
+        os.makedirs("/usr/share/tavo", exist_ok=True)
+        shutil.copy(f"{HERE}/../../packaging/routersdk_version", "/usr/share/tavo")
+        start = time.monotonic()
+        os.unlink(VERSION)
+        self.assertEqual((update_upnp(), update_models()), ((1, 1), (1, 3)))
+        self.assertLess(time.monotonic() - start, 3)
+        self.assertEqual(LAB.read(UPNP), "", "nor is it looked for again")
+
     def test_a_server_with_faults(self):
         both = (update_models, update_upnp)
-        for fault, calls, seconds in (("half", both, 10), ("missing", both, 10), ("portal", both, 10), ("endless", both, 60),
-                                      ("stalls", both[1:], 60)):
+        for fault, calls, seconds, why in (
+                ("half", both, 10, "came to nothing|cut|closed"), ("missing", both, 10, "answered 404"),
+                ("portal", both, 10, "web page"), ("endless", both, 60, "64 MiB"), ("stalls", both[1:], 60, ""),
+                ("dead", both, 10, "refused")):
             with self.subTest(fault=fault):
-                self.serve_from(fault)
+                self.serve_from(fault, 8001 if fault == "dead" else 8000)
                 for call in calls:
                     start = time.monotonic()
                     self.assertEqual(call()[0], 0)
                     self.assertLess(time.monotonic() - start, seconds)
                 self.unchanged()
+                if why:
+                    self.assertRegex(update_in_words(), f"{WAN}:800./{fault}/routerdb.tgz: .*({why})")
 
     def test_archives_that_mean_harm(self):
         LAB.write("/tmp/victim", "untouched")

@@ -126,6 +126,10 @@ TEST_F(Library, RuleFilesThatCannotBeConverted) {
         EXPECT_EQ(nRules, broken.nRules) << broken.szText;
         EXPECT_EQ(pRules, nullptr);
     }
+    int nRules = 7;
+    Rule* pRules = nullptr;
+    EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr), 0) << "no longer broken";
+    EXPECT_EQ(nRules, 0);
     auto enErr = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
     gLog.clear();
     EXPECT_EQ(TLibGetRulesArrFromTestRuleConf(nullptr, nullptr, nullptr, true, &enErr), -1);

@@ -83,11 +83,12 @@ int TLIBCFileExist(const char* szPath);
 int TLIBCFileTouch(const char* szPath);
 
 /* Reads the pairs of one section into pHash. Number of pairs read; 0: the section is absent or empty;
- * negative: the file cannot be read or parsed. Of two sections with one name the first counts, which is
- * logged; of two pairs with one key the last. */
+ * negative: the file cannot be read or parsed. Two sections of one name are read as one; of two pairs with
+ * one key the last counts. */
 int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* pHash);
 /* Writes the section at the end of the file, which is created 0600 when missing; a section of that
- * name is replaced where it stands. nFlags: reserved, 0. 1: written; negative: failed. */
+ * name is replaced where it stands, and further ones of that name go. nFlags: reserved, 0.
+ * 1: written; negative: failed. */
 int TLIBCFileAddSection(const char* szPath, const char* szSection, const TLIBCSzHash* pHash, int nFlags);
 /* One value of one section, cut at nSize - 1 bytes. 0: found; negative: file, section or key missing. */
 int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const char* szKey, char* szValue, int nSize);

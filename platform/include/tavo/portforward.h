@@ -33,6 +33,7 @@ void TAVOPFConfFree(TAVO_PF_CONF* pHead);
 /* All sections of /etc/portforward/rule.conf (testrule.conf), in file order. NULL: no file, an empty
  * one, or one that cannot be parsed, has a section name that does not fit or more than 16384 sections
  * (the last error tells them apart: TLIBC_ERR_NONE for empty, TLIBC_ERR_NOT_FOUND for no file).
+ * Blank lines and comments alone are an empty file, and are taken out of it.
  * A writer moves the old file aside, to its name and six more letters and digits, before it writes the
  * new one. Where it was killed in between, the newest such copy is put back before the file is read;
  * copies that later writes made obsolete are deleted once they are ten minutes old. */
@@ -59,7 +60,12 @@ int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, co
 /* 1: 1 to 65535; 0: anything else. */
 int TAVOPFIsValidPortNo(int nPort);
 
-/* ---- router description database, /etc.defaults/portforward/routerdb --------------------------- */
+/* ---- router descriptions -------------------------------------------------------------------------
+ * /etc.defaults/portforward/routerdb holds what is downloaded, /etc/tavo/routerdb what the box's owner wrote,
+ * in the same form; the owner's description of a model and version comes before a downloaded one. The owner's
+ * models get links in the downloaded database, for those who look there by path: RouterDBList and
+ * TAVOPFRouterDBUpdate make them, where they have the right to, and take away those whose description is gone.
+ */
 
 /* Names of all known models: "brand: model(version)", or "brand: model" for a model with a "generic"
  * file; sorted. Number of names with *ppList set (caller frees); negative: no database or bad input. */
@@ -70,10 +76,14 @@ int RouterDBList(TLIBCSzList** ppList);
  * model, unreadable file, or a name that is no plain file name; outputs untouched. */
 int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF** ppDesc, TAVO_ROUTER_SCRIPT** ppOps);
 void TAVORouterScriptFree(TAVO_ROUTER_SCRIPT* pOps);
-/* Fetches the database anew from GetRouterDBPath() and puts it in place only when it is whole.
- * Its version (the "version" key of the database's "version" file); negative: failed, the old one stays. */
+/* Fetches the database anew from GetRouterDBPath() and puts it in place only when it is whole, no description
+ * in it needs a newer syntax than this box's, and its edition is not older than the installed one. Its edition
+ * (the "version" key of the database's "version" file); negative: failed, the old one stays, which is logged
+ * with the reason. Without a location nothing is attempted: the installed edition, 0 for none. */
 int TAVOPFRouterDBUpdate(void);
-/* Where the databases are downloaded from (server and directory); static storage. */
+/* Why the last TAVOPFRouterDBUpdate of this thread failed, for a person; "": it did not. */
+const char* TAVOPFRouterDBWhy(void);
+/* Where the databases are downloaded from (server and directory); "": nowhere. Static storage, per thread. */
 const char* GetRouterDBPath(void);
 
 #ifdef __cplusplus

@@ -136,16 +136,16 @@ int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* 
         if (!rgSections) {
             return -1;
         }
-        const tavo::Section* pSection = tavo::FindSection(*rgSections, szSection, szPath);
-        if (pSection == nullptr) {
+        const auto section = tavo::FindSection(*rgSections, szSection);
+        if (!section) {
             return 0;
         }
-        for (const tavo::Pair& pair : pSection->rgPairs) {
+        for (const tavo::Pair& pair : section->rgPairs) {
             if (TLIBCSzHashSetValue(pHash, pair.szKey.c_str(), pair.szValue.c_str()) < 0) {
                 return -1;
             }
         }
-        return static_cast<int>(pSection->rgPairs.size());
+        return static_cast<int>(section->rgPairs.size());
     });
 }
 
@@ -169,15 +169,13 @@ int TLIBCFileAddSection(const char* szPath, const char* szSection, const TLIBCSz
         for (int i = 0; TLIBCSzHashGetAt(pHash, i, &szKey, &szValue) == 1; ++i) {
             section.rgPairs.push_back({szKey, szValue == nullptr ? "" : szValue});
         }
-        bool blPlaced = false;
-        for (tavo::Section& old : rgSections) {
-            if (!blPlaced && old.szName == section.szName) {
-                old = section;
-                blPlaced = true;
-            }
-        }
-        if (!blPlaced) {
+        const auto fnSameName = [&](const tavo::Section& old) { return old.szName == section.szName; };
+        const auto first = std::find_if(rgSections.begin(), rgSections.end(), fnSameName);
+        if (first == rgSections.end()) {
             rgSections.push_back(std::move(section));
+        } else {
+            rgSections.erase(std::remove_if(first + 1, rgSections.end(), fnSameName), rgSections.end());
+            *first = std::move(section);
         }
         return tavo::WriteFileAtomic(szPath, tavo::FormatSections(rgSections)) ? 1 : -1;
     });
@@ -192,14 +190,14 @@ int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const ch
         if (!rgSections) {
             return -1;
         }
-        const tavo::Section* pSection = tavo::FindSection(*rgSections, szSection, szPath);
-        if (pSection == nullptr) {
+        const auto section = tavo::FindSection(*rgSections, szSection);
+        if (!section) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
         // The last of two pairs with one key counts, as in a hash.
-        const auto it = std::find_if(pSection->rgPairs.rbegin(), pSection->rgPairs.rend(),
+        const auto it = std::find_if(section->rgPairs.rbegin(), section->rgPairs.rend(),
                                      [szKey](const tavo::Pair& pair) { return pair.szKey == szKey; });
-        if (it == pSection->rgPairs.rend()) {
+        if (it == section->rgPairs.rend()) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
         CopyOut(it->szValue, szValue, nSize);

@@ -22,7 +22,6 @@ namespace {
 
 constexpr char kFile[] = "platform/linux/core/TextFile.cpp";
 constexpr size_t kMaxFile = 16U << 20U;
-constexpr size_t kMaxLoggedName = 200;
 constexpr char kHexDigits[] = "0123456789abcdef";
 
 bool Fail(int nErr, int nLine) {
@@ -363,20 +362,18 @@ std::optional<std::vector<Section>> LoadSections(const std::string& szPath) {
     return rgSections;
 }
 
-const Section* FindSection(const std::vector<Section>& rgSections, std::string_view szName, const char* szPath) {
-    const Section* pFound = nullptr;
+std::optional<Section> FindSection(const std::vector<Section>& rgSections, std::string_view szName) {
+    std::optional<Section> found;
     for (const Section& section : rgSections) {
         if (section.szName != szName) {
             continue;
         }
-        if (pFound != nullptr) {
-            syslog(LOG_WARNING, "%s: more than one section [%s]; the first counts", szPath,
-                   PrintableText(szName, kMaxLoggedName).c_str());
-            break;
+        if (!found) {
+            found = Section{section.szName, {}};
         }
-        pFound = &section;
+        found->rgPairs.insert(found->rgPairs.end(), section.rgPairs.begin(), section.rgPairs.end());
     }
-    return pFound;
+    return found;
 }
 
 std::string FormatSections(const std::vector<Section>& rgSections) {

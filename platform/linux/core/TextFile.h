@@ -45,8 +45,8 @@ TAVO_PLATFORM_API std::optional<std::vector<Section>> ParseSections(std::string_
                                                                     size_t* pnBadLine = nullptr);
 // The same for a file; the line that spoils it is logged.
 std::optional<std::vector<Section>> LoadSections(const std::string& szPath);
-// The first section of that name, or null; that there is another one in szPath is logged.
-const Section* FindSection(const std::vector<Section>& rgSections, std::string_view szName, const char* szPath);
+// All pairs that stand under that name, in file order: a section that was begun again goes on.
+std::optional<Section> FindSection(const std::vector<Section>& rgSections, std::string_view szName);
 TAVO_PLATFORM_API std::string FormatSections(const std::vector<Section>& rgSections);
 
 // One line of a key file as key and value; nothing for blank lines, comments and what is neither.

@@ -1,17 +1,12 @@
-// The router description database: model names, descriptions with their operations, and the refresh.
-// Relies on sectioned files below the database's directory, on wget and tar for the refresh.
-// Promises: no name leads outside the directory; a refresh that fails leaves the old database.
-#include <stdlib.h>
-#include <sys/stat.h>
+// The router descriptions: names of the models, descriptions with their operations. Relies on sectioned files
+// in two directories. Promises: no name leads outside them; see RouterDatabase.h.
+#include "portforward/RouterDatabase.h"
+
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstring>
-#include <filesystem>
 #include <memory>
 #include <new>
-#include <string>
-#include <vector>
 
 #include "core/Border.h"
 #include "core/Directory.h"
@@ -19,18 +14,19 @@
 #include "portforward/ConfList.h"
 #include "portforward/RouterScript.h"
 
-namespace {
-
 namespace fs = std::filesystem;
 
+namespace {
+
 constexpr char kFile[] = "platform/linux/portforward/RouterDatabase.cpp";
-constexpr char kDatabase[] = "/etc.defaults/portforward/routerdb";
-constexpr char kArchive[] = "routerdb.tgz";
-constexpr int kLocationSize = 1024;
+constexpr char kGeneric[] = "generic";
 constexpr int kVersionSize = 1024;
 
 using tavo::AtBorder;
+using tavo::Directories;
 using tavo::IsPathPart;
+using tavo::kDatabase;
+using tavo::kOwnDatabase;
 using tavo::Value;
 
 int Fail(int nErr, int nLine) {
@@ -43,14 +39,6 @@ bool IsDirectory(const fs::path& path) {
     return fs::is_directory(path, error);
 }
 
-// Throws when the directory cannot be read: a list is whole or absent.
-std::vector<std::string> Directories(const fs::path& dir) {
-    std::vector<std::string> rgszNames = tavo::NamesIn(dir).value();
-    std::erase_if(rgszNames, [&dir](const std::string& szName) { return !IsDirectory(dir / szName); });
-    std::sort(rgszNames.begin(), rgszNames.end());
-    return rgszNames;
-}
-
 bool IsFile(const fs::path& path) {
     std::error_code error;
     return fs::is_regular_file(path, error);
@@ -59,131 +47,142 @@ bool IsFile(const fs::path& path) {
 // The version whose directory holds a model's generic description; empty when it has none.
 std::string GenericVersion(const fs::path& model) {
     char szVersion[kVersionSize] = {};
-    const fs::path generic = model / "generic";
+    const fs::path generic = model / kGeneric;
     if (TLIBCFileGetKeyValue(generic.c_str(), "version", szVersion, sizeof(szVersion), 0) >= 1) {
         return szVersion;
     }
     return TLIBCErrGet() == TLIBC_ERR_NO_MEMORY ? throw std::bad_alloc() : "";
 }
 
-void Push(TLIBCSzList* pList, const std::string& szName) {
-    if (TLIBCSzListPush(pList, szName.c_str()) < 0) {
-        throw std::bad_alloc();
-    }
-}
-
-void ListModel(TLIBCSzList* pList, const std::string& szBrand, const std::string& szModel, const fs::path& model) {
+// The names of one model: any version first, as "generic" of the database says it, since the library reads it there.
+void AddNames(const std::string& szBrand, const std::string& szModel, std::vector<std::string>& rgszNames) {
     const std::string szName = szBrand + ": " + szModel;
-    if (!GenericVersion(model).empty()) {
-        Push(pList, szName);
+    if (!GenericVersion(fs::path(kDatabase) / szBrand / szModel).empty()) {
+        rgszNames.push_back(szName);
     }
-    for (const std::string& szVersion : Directories(model)) {
-        if (IsFile(model / szVersion / "router.des")) {
-            Push(pList, szName + "(" + szVersion + ")");
+    for (const char* szPlace : {kDatabase, kOwnDatabase}) {
+        const fs::path model = fs::path(szPlace) / szBrand / szModel;
+        for (const std::string& szVersion : IsDirectory(model) ? Directories(model) : std::vector<std::string>()) {
+            if (IsFile(model / szVersion / "router.des")) {
+                rgszNames.push_back(szName + "(" + szVersion + ")");
+            }
         }
     }
 }
 
 // The directory of a router's description; empty when it has none.
 fs::path DescriptionDir(const TAVO_PF_CONF* pSection) {
-    const std::string szBrand = Value(pSection, "brand");
-    const std::string szModel = Value(pSection, "model");
-    if (!IsPathPart(szBrand) || !IsPathPart(szModel)) {
+    const fs::path brand = Value(pSection, "brand");
+    const fs::path model = Value(pSection, "model");
+    if (!IsPathPart(brand.native()) || !IsPathPart(model.native())) {
         return {};
     }
-    const fs::path model = fs::path(kDatabase) / szBrand / szModel;
-    for (const std::string& szVersion : {Value(pSection, "version"), GenericVersion(model)}) {
-        if (IsPathPart(szVersion) && IsFile(model / szVersion / "router.des")) {
-            return model / szVersion;
+    const fs::path own = kOwnDatabase / brand / model;
+    const fs::path downloaded = kDatabase / brand / model;
+    const std::string szVersion = Value(pSection, "version");
+    for (const auto& [dir, szTried] :
+         {std::pair(own, szVersion), std::pair(downloaded, szVersion), std::pair(own, GenericVersion(own)),
+          std::pair(downloaded, GenericVersion(downloaded))}) {
+        if (IsPathPart(szTried) && IsFile(dir / szTried / "router.des")) {
+            return dir / szTried;
         }
     }
     return {};
 }
 
-// A directory beside the database that goes away with the object.
-class Scratch {
-public:
-    Scratch() : mSzPath(std::string(kDatabase) + ".XXXXXX") { mBlMade = mkdtemp(mSzPath.data()) != nullptr; }
-    ~Scratch() {
-        std::error_code error;
-        if (mBlMade) {
-            fs::remove_all(mSzPath, error);
-        }
-    }
-    Scratch(const Scratch&) = delete;
-    Scratch& operator=(const Scratch&) = delete;
-
-    bool IsMade() const { return mBlMade; }
-    fs::path Path() const { return mSzPath; }
-
-private:
-    std::string mSzPath;
-    bool mBlMade;
-};
-
-// A name between single quotes of a shell command.
-std::string Quoted(const std::string& szText) {
-    std::string szOut = "'";
-    for (const char c : szText) {
-        szOut += c == '\'' ? std::string("'\\''") : std::string(1, c);
-    }
-    return szOut + "'";
-}
-
-bool FetchAndUnpack(const fs::path& scratch) {
-    const std::string szArchive = Quoted(scratch / kArchive);
-    const std::string szTar = Quoted(scratch / "tar");
-    const std::string szNew = Quoted(scratch / "new");
-    // 64 MiB bound what a server can fill the disk with: as it arrives, and in one file as it unpacks. tar
-    // would mend a name that leads outside; who packs such a name means harm, and the whole archive is refused.
-    const std::string szCommand =
-        "ulimit -f 131072; export LC_ALL=C; exec >/dev/null 2>&1; timeout 300 "
-        "/usr/tavo/bin/wget " +
-        Quoted(std::string(GetRouterDBPath()) + "/" + kArchive) + " -O " + szArchive + " && timeout 60 gzip -dc " +
-        szArchive + " >" + szTar + " && ! tar -tf " + szTar + " | grep -qE '^/|(^|/)[.][.](/|$)' && mkdir " + szNew +
-        " && timeout 60 tar -xf " + szTar + " -C " + szNew + " --no-same-owner";
-    return TLIBCSystem(szCommand.c_str()) == 0;
-}
-
-bool HoldsOnlyFilesAndDirectories(const fs::path& dir) {
+// A link to what the owner wrote, in the place of a file or an older link, never of a directory.
+void Link(const fs::path& target, const fs::path& link) {
     std::error_code error;
-    for (fs::recursive_directory_iterator it(dir, error), end; it != end; it.increment(error)) {
-        if (error || it->is_symlink(error) || (!it->is_regular_file(error) && !it->is_directory(error))) {
-            return false;
-        }
+    const bool blLink = fs::is_symlink(link, error);
+    if (blLink ? fs::read_symlink(link, error) == target : IsDirectory(link)) {
+        return;
     }
-    return !error;
+    fs::create_directories(link.parent_path(), error);
+    const fs::path fresh = link.native() + ".new";
+    fs::remove(fresh, error);
+    fs::create_symlink(target, fresh, error);
+    if (!error) {
+        fs::rename(fresh, link, error);
+    }
 }
 
-// Puts the new database in the old one's place; the old one comes back when that fails.
-bool Swap(const fs::path& fresh, const fs::path& aside) {
-    const bool blOld = TLIBCFileExist(kDatabase) == 1;
-    if (blOld && rename(kDatabase, aside.c_str()) != 0) {
-        return false;
+bool IsGone(const fs::path& link) {
+    std::error_code error;
+    const fs::path target = fs::is_symlink(link, error) ? fs::read_symlink(link, error) : fs::path();
+    return target.native().starts_with(std::string(kOwnDatabase) + "/") && !fs::exists(target, error);
+}
+
+void UnlinkGone(const fs::path& database) {
+    for (const std::string& szBrand : Directories(database)) {
+        for (const std::string& szModel : Directories(database / szBrand)) {
+            const fs::path model = database / szBrand / szModel;
+            const auto rgszNames = tavo::NamesIn(model);
+            for (const std::string& szName : rgszNames.value()) {
+                if (IsGone(model / szName)) {
+                    unlink((model / szName).c_str());
+                }
+            }
+        }
     }
-    if (rename(fresh.c_str(), kDatabase) == 0) {
-        return true;
-    }
-    if (blOld && rename(aside.c_str(), kDatabase) != 0) {
-        Fail(TLIBC_ERR_RENAME, __LINE__);
-    }
-    return false;
 }
 
 }  // namespace
+
+namespace tavo {
+
+std::vector<std::string> Directories(const fs::path& dir) {
+    std::vector<std::string> rgszNames = NamesIn(dir).value();
+    std::erase_if(rgszNames, [&dir](const std::string& szName) { return !IsDirectory(dir / szName); });
+    std::sort(rgszNames.begin(), rgszNames.end());
+    return rgszNames;
+}
+
+void LinkOwnDescriptions(const fs::path& database) {
+    if (IsDirectory(database)) {
+        UnlinkGone(database);
+    }
+    if (!IsDirectory(kOwnDatabase)) {
+        return;
+    }
+    for (const std::string& szBrand : Directories(kOwnDatabase)) {
+        for (const std::string& szModel : Directories(fs::path(kOwnDatabase) / szBrand)) {
+            const fs::path own = fs::path(kOwnDatabase) / szBrand / szModel;
+            for (const std::string& szName : Directories(own)) {
+                Link(own / szName, database / szBrand / szModel / szName);
+            }
+            if (IsFile(own / kGeneric)) {
+                Link(own / kGeneric, database / szBrand / szModel / kGeneric);
+            }
+        }
+    }
+}
+
+}  // namespace tavo
 
 int RouterDBList(TLIBCSzList** ppList) {
     return AtBorder(-1, [&] {
         if (ppList == nullptr) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        if (!IsDirectory(kDatabase)) {
+        tavo::LinkOwnDescriptions(kDatabase);
+        if (!IsDirectory(kDatabase) && !IsDirectory(kOwnDatabase)) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
+        std::vector<std::string> rgszNames;
+        for (const char* szPlace : {kDatabase, kOwnDatabase}) {
+            for (const std::string& szBrand :
+                 IsDirectory(szPlace) ? Directories(szPlace) : std::vector<std::string>()) {
+                for (const std::string& szModel : Directories(fs::path(szPlace) / szBrand)) {
+                    AddNames(szBrand, szModel, rgszNames);
+                }
+            }
+        }
+        std::sort(rgszNames.begin(), rgszNames.end());
+        rgszNames.erase(std::unique(rgszNames.begin(), rgszNames.end()), rgszNames.end());
         std::unique_ptr<TLIBCSzList, decltype(&TLIBCSzListFree)> pList(TLIBCSzListAlloc(0), &TLIBCSzListFree);
-        for (const std::string& szBrand : Directories(kDatabase)) {
-            for (const std::string& szModel : Directories(fs::path(kDatabase) / szBrand)) {
-                ListModel(pList.get(), szBrand, szModel, fs::path(kDatabase) / szBrand / szModel);
+        for (const std::string& szName : rgszNames) {
+            if (TLIBCSzListPush(pList.get(), szName.c_str()) < 0) {
+                throw std::bad_alloc();
             }
         }
         *ppList = pList.release();
@@ -216,39 +215,4 @@ int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF*
 
 void TAVORouterScriptFree(TAVO_ROUTER_SCRIPT* pOps) {
     delete pOps;
-}
-
-int TAVOPFRouterDBUpdate() {
-    return AtBorder(-1, [&] {
-        const Scratch scratch;
-        if (!scratch.IsMade()) {
-            return Fail(TLIBC_ERR_OPEN, __LINE__);
-        }
-        const fs::path fresh = scratch.Path() / "new";
-        char szVersion[kVersionSize] = {};
-        if (!FetchAndUnpack(scratch.Path())) {
-            return Fail(TLIBC_ERR_READ, __LINE__);
-        }
-        if (!HoldsOnlyFilesAndDirectories(fresh) ||
-            TLIBCFileGetKeyValue((fresh / "version").c_str(), "version", szVersion, sizeof(szVersion), 0) < 1) {
-            return Fail(TLIBC_ERR_FORMAT, __LINE__);
-        }
-        const long nVersion = std::strtol(szVersion, nullptr, 10);
-        if (nVersion < 0 || nVersion > INT32_MAX || chmod(fresh.c_str(), 0755) != 0) {
-            return Fail(TLIBC_ERR_FORMAT, __LINE__);
-        }
-        return Swap(fresh, scratch.Path() / "old") ? static_cast<int>(nVersion) : Fail(TLIBC_ERR_RENAME, __LINE__);
-    });
-}
-
-const char* GetRouterDBPath() {
-    static thread_local char szLocation[kLocationSize];
-    TLIBPlatformSettingGet("download", "database_url", "http://localhost/tavo", szLocation, sizeof(szLocation));
-    // The location stands between quotes in commands: one that could leave them is no location, nor is one
-    // that was cut.
-    if (std::strpbrk(szLocation, "'\\\n\r") != nullptr || szLocation[0] == '-' ||
-        std::strlen(szLocation) == sizeof(szLocation) - 1) {
-        szLocation[0] = '\0';
-    }
-    return szLocation;
 }

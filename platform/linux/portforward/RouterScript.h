@@ -3,6 +3,13 @@
 
 #include "portforward/ConfList.h"
 
+namespace tavo {
+
+// The version of the syntax of descriptions and operations that this box understands.
+inline constexpr int kSyntaxVersion = 1;
+
+}  // namespace tavo
+
 struct tag_TAVO_ROUTER_SCRIPT {
     tavo::ConfList pOperations;  // in file order; null: the model has none, or they cannot be read
 };

@@ -1,7 +1,10 @@
 // Rule and router files as lists of nodes, and the counts that the capacity checks use.
 // Relies on TextFile and on the description of the router for the count of jobs.
 // Promises: a list is whole or absent; a file is replaced whole or left alone.
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <climits>
@@ -11,6 +14,7 @@
 #include <new>
 
 #include "core/Border.h"
+#include "core/Descriptor.h"
 #include "portforward/Aside.h"
 #include "portforward/ConfList.h"
 #include "portforward/PortText.h"
@@ -29,6 +33,21 @@ using tavo::AtBorder;
 using tavo::ConfList;
 using tavo::Value;
 
+// A file of blank lines and comments holds nothing, but whoever goes by its size takes it for a broken one: it
+// is emptied. In place, so that a writer's newer file is never meant; one that cannot be changed stays.
+void EmptyOut(const char* szPath) {
+    const tavo::Descriptor fd(open(szPath, O_RDWR | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+    struct stat status = {};
+    if (fd.Get() < 0 || fstat(fd.Get(), &status) != 0 || !S_ISREG(status.st_mode) || status.st_size == 0) {
+        return;
+    }
+    const auto szText = tavo::ReadFile("/proc/self/fd/" + std::to_string(fd.Get()));
+    const auto rgSections = szText ? tavo::ParseSections(*szText) : std::nullopt;
+    if (rgSections && rgSections->empty() && ftruncate(fd.Get(), 0) != 0) {
+        syslog(LOG_WARNING, "%s holds no section and cannot be emptied", szPath);
+    }
+}
+
 TAVO_PF_CONF* Load(const char* szPath) {
     return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] {
         ConfList pList = tavo::LoadConfList(szPath);
@@ -40,6 +59,10 @@ TAVO_PF_CONF* Load(const char* szPath) {
         }
         if (TLIBCErrGet() == TLIBC_ERR_NONE) {
             tavo::DropObsolete(szPath);
+            if (!pList) {
+                EmptyOut(szPath);
+                TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
+            }
         }
         return pList.release();
     });

@@ -263,6 +263,6 @@ int TAVOUpnpReportTestProgress(const char* szStep, const char* szValue, int /*nF
 
 const char* GetUPnPReportServer() {
     static char szServer[1024];
-    TLIBPlatformSettingGet("report", "server", "http://localhost/tavo/report", szServer, sizeof(szServer));
+    TLIBPlatformSettingGet("report", "server", "", szServer, sizeof(szServer));
     return szServer;
 }

@@ -38,11 +38,14 @@ int Setting(const char* szSection, const char* szKey, const char* szDefault, int
 }  // namespace
 
 RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
-    : mNames(names),
-      mBlRequestRenews(blRequestRenews),
-      mNCheckSeconds(Setting(names.szName, "check_interval", "120", 1, 3600)),
-      mNWishedLease(static_cast<uint32_t>(Setting(names.szName, "lease", "3600", 20, 604800))),
-      mTold(names.szName) {}
+    : mNames(names), mBlRequestRenews(blRequestRenews), mTold(names.szName) {
+    ReadSettings();
+}
+
+void RuleMapper::ReadSettings() {
+    mNCheckSeconds = Setting(mNames.szName, "check_interval", "120", 1, 3600);
+    mNWishedLease = static_cast<uint32_t>(Setting(mNames.szName, "lease", "3600", 20, 604800));
+}
 
 // Whether the run key has come back: a save or a detection that was killed leaves it off.
 bool RuleMapper::MendRunKeys() {
@@ -133,6 +136,7 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
         blRequested = MendRunKeys() || blRequested;
     }
     if (blRequested) {
+        ReadSettings();
         ReadRules();
     }
     PassResult result = Pass(blRequested, fnStop);

@@ -55,6 +55,7 @@ protected:
 
 private:
     bool MendRunKeys();
+    void ReadSettings();
     void ReadRules();
     bool FindGateway();
     bool TakeTurn(const std::function<bool()>& fnStop);
@@ -69,8 +70,8 @@ private:
 
     const DaemonNames& mNames;
     bool mBlRequestRenews;
-    int mNCheckSeconds;
-    uint32_t mNWishedLease;
+    int mNCheckSeconds = 0;
+    uint32_t mNWishedLease = 0;
     WantedSet mWanted;
     bool mBlRulesRead = false;
     bool mBlMended = false;  // no killed save or detection has left our run key off

@@ -10,12 +10,9 @@
 
 #include "daemons/tavoportforward/Pattern.h"
 #include "daemons/tavoportforward/WebClient.h"
-#include "tavo/portforward.h"
+#include "portforward/RouterScript.h"
 
 namespace tavo {
-
-// The version of the syntax that this tool understands.
-inline constexpr int kSyntaxVersion = 1;
 
 // The steps, as their sections are named. Each is all sections of its name, in file order.
 inline constexpr char kStepLogin[] = "login";

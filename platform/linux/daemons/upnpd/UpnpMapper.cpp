@@ -17,9 +17,7 @@ constexpr int kOutsideMilliseconds = 2000;
 
 }  // namespace
 
-UpnpMapper::UpnpMapper() : RuleMapper(kNames, false) {
-    mHabit.nLease = WishedLease();
-}
+UpnpMapper::UpnpMapper() : RuleMapper(kNames, false) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();
@@ -57,6 +55,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool 
         return result;
     }
     mPIgd->SetStop(fnStop);
+    mHabit.nLease = WishedLease();
     const bool blPermanentOnly = mHabit.blPermanentOnly;
     PassResult result = Reconcile(*mPIgd, rgWanted, Box(), mHabit, blRenew, fnStop);
     result.enRouter = result.nTransport == kRouterOk ? RouterState::kOk : RouterState::kSilent;
