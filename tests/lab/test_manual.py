@@ -1,10 +1,11 @@
 """Routers that have web pages only: rules saved on the box, a stranger outside, and pages with faults."""
+import json
 import os
 import signal
 import time
 import unittest
 
-from homelab import BOX, HERE, LAN2, run_tests, wait_for
+from homelab import BOX, GATEWAY, HERE, LAN2, run_tests, wait_for
 
 LAB = None
 TOOL = "/usr/tavo/bin/tavoportforward"
@@ -30,6 +31,12 @@ class Manual(unittest.TestCase):
             if os.path.exists(path):
                 os.unlink(path)
 
+    def rows(self):
+        """What is published of each port: state and reason, and what the router is like."""
+        state = json.loads(LAB.read("/run/tavo/tavoportforward.json"))
+        self.assertEqual((state["protocol"], state["gateway"], state["box"]), ("pages", GATEWAY, BOX))
+        return {row["name"]: (row["state"], row["why"] or "") for row in state["rules"]}, state
+
     def forwards(self):
         """The router's table without the other box's line, as single forwards."""
         return {(protocol, row["first"] + i): (row["host"], row["port"] + i) for row in LAB.web_state()["table"]
@@ -41,6 +48,7 @@ class Manual(unittest.TestCase):
         self.assertEqual((answer["result"], answer["status"], events()), (0, 0, ""))
         self.assertEqual(self.forwards(), {**wanted, **FOREIGN})
         self.assertEqual(LAB.mappings(), self.forwards())
+        self.assertEqual(self.rows()[0], {f"{port}/{protocol}": ("open", "") for protocol, port in wanted})
 
     def test_saves_in_a_row(self):
         single = {("tcp", 5001): (BOX, 5001), ("udp", 5001): (BOX, 5001)}
@@ -73,6 +81,9 @@ class Manual(unittest.TestCase):
         LAB.save("1,1,tcp,9999,5001", "2,1,tcp,5001,5001")
         self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
         self.assertIn("9999/tcp (the router already forwards this port for something else)", events())
+        self.assertEqual(self.rows()[0], {"9999/tcp": ("refused", "the router already forwards this port for something else"),
+                                          "5001/tcp": ("open", "")})
+        self.assertIn({"address": LAN2, "description": "tavo:another box"}, [row["holder"] for row in self.rows()[1]["rules"]])
         LAB.stop_router()
         LAB.start_web("blind")
         LAB.save("1,1,tcp,5001,5002", "2,1,tcp,9999,9999")
@@ -97,6 +108,10 @@ class Manual(unittest.TestCase):
                 self.assertLess(time.monotonic() - start, seconds)
                 self.assertIn("ports: 5001/tcp (", events())
                 self.assertIn(why, events())
+                rows, state = self.rows()
+                known = {"hangs": ("unknown", "silent"), "hangs_on_add": ("unknown", "silent"), "endless": ("unknown", "ok")}
+                self.assertEqual((rows["5001/tcp"][0], state["router"]), known.get(fault, ("refused", "ok")))
+                self.assertIn(why, rows["5001/tcp"][1])
                 self.assertGreater(len(LAB.web_state()["count"]), 1, "the fault was reached")
                 self.assertEqual(self.forwards(), FOREIGN)
                 LAB.stop_router()
@@ -137,6 +152,7 @@ class Manual(unittest.TestCase):
         self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
         LAB.save("1,1,tcp,5001,5001")
         self.assertIn("removal of 5001/tcp (", events())
+        self.assertEqual([row["name"] for row in self.rows()[1]["left_over"]], ["5001/tcp"])
         os.unlink(EVENTS)
         self.saved({})
 
@@ -163,13 +179,20 @@ class Database(unittest.TestCase):
                  ("[global]\nsyntax version=2\n" + good, '"syntax version" of [global]'),
                  ("[PF add port]\npath=/a\n", "[PF delete port] is missing"), (good + "[PF lst]\npath=/l\n", "[PF lst]"),
                  (good + "path=http://192.168.77.3/\n", '"path" of'), (good + "take x=([0-9\n", '"take x" of'),
-                 (good + "header X: y=z\n", '"header X: y" of'), ("no sections\n", "no sectioned file"))
-        for text, why in table:
-            with self.subTest(text=text):
-                LAB.write("/tmp/router.ops", text)
-                out = LAB.run("box", f"{TOOL} --check /tmp/router.ops", check=False)
-                self.assertEqual((out.returncode, why in out.stdout), (1, True), out.stdout)
-        samples = f"find {HERE}/../../packaging/routerdb -name router.ops -exec {TOOL} --check {{}} +"
+                 (good + "header X: y=z\n", '"header X: y" of'), ("no sections\n", "no sectioned file"),
+                 (good + "take x=groupless\n", '"take x" of'), (good + "form={id}\n", "{id} in [PF delete port]"),
+                 ("[login]\npath=/{token}\n" + good + "take token=(x)\n", "{token} in [login]"),
+                 (good + "[PF list]\npath=/\nentry=(?<router_first>.)\n", '"entry" of'))
+        descriptions = (("[PF port page]\ntcp=\n", "no \"max rule\""), ("[PF port page]\nmax rule=0\n", '"max rule" of'),
+                        ("[PF prot page]\nmax rule=1\n", "[PF prot page] is no section"),
+                        ("[PF range page]\nmax rule=1\ntpc=1\n", '"tpc" of'), ("[global]\n", "[PF port page] is missing"))
+        for kind, rows in (("ops", table), ("des", descriptions)):
+            for text, why in rows:
+                with self.subTest(text=text):
+                    LAB.write(f"/tmp/router.{kind}", text)
+                    out = LAB.run("box", f"{TOOL} --check /tmp/router.{kind}", check=False)
+                    self.assertEqual((out.returncode, why in out.stdout), (1, True), out.stdout)
+        samples = f"find {HERE}/../../packaging/routerdb -name 'router.*' -exec {TOOL} --check {{}} +"
         self.assertEqual(LAB.run("box", samples).stdout, "")
 
 

@@ -57,6 +57,9 @@ size_t CharacterSize(std::string_view szText) {
 }  // namespace
 
 std::string WhyOf(const Verdict& verdict) {
+    if (!verdict.szWhy.empty()) {
+        return verdict.szWhy;
+    }
     if (verdict.enState == PortState::kOpen) {
         return verdict.blOthers ? kOthersMade : "";
     }

@@ -45,6 +45,7 @@ struct Verdict {
     uint32_t nLease = 0;                // seconds left; 0: permanent, or not known
     bool blOthers = false;              // another program of this box made it, or has the port for something else
     bool blAnew = false;                // open, and was not there before this pass
+    std::string szWhy = {};             // where the word alone does not say it
 };
 
 struct Outcome {

@@ -37,7 +37,7 @@ std::string ServiceOf(const TAVO_PF_CONF* pRule) {
 // What no router is asked for, under a name for the status file.
 Outcome RefusedRule(const std::string& szName, const char* szWord, const TAVO_PF_CONF* pRule) {
     Outcome outcome{KeyText(szName), {PortState::kRefused, szWord}};
-    outcome.szRule = HarmlessText(ServiceOf(pRule), kMaxRuleText);
+    outcome.szRule = RuleTitle(pRule);
     return outcome;
 }
 
@@ -58,7 +58,7 @@ void AddRule(const TAVO_PF_CONF* pRule, const std::vector<SingleMapping>& rgSing
             single.szProtocol, single.nRouterPort, single.nBoxPort, "", MappingDescription(pRule), 0, true};
         const auto [it, blNew] = mapBoxPorts.try_emplace(MappingName(mapping), mapping.nBoxPort);
         if (blNew) {
-            wanted.mapRules[it->first] = HarmlessText(ServiceOf(pRule), kMaxRuleText);
+            wanted.mapRules[it->first] = RuleTitle(pRule);
             wanted.rgMappings.push_back(std::move(mapping));
         } else if (it->second != mapping.nBoxPort) {
             wanted.rgRefused.push_back(Duplicate(mapping, pRule));
@@ -74,6 +74,10 @@ std::string MappingDescription(const TAVO_PF_CONF* pRule) {
         szText += c >= ' ' && c <= '~' ? c : '_';
     }
     return szText.substr(0, kMaxDescription);
+}
+
+std::string RuleTitle(const TAVO_PF_CONF* pRule) {
+    return HarmlessText(ServiceOf(pRule), kMaxRuleText);
 }
 
 std::string RuleName(const TAVO_PF_CONF* pRule) {

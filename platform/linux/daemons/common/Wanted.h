@@ -32,6 +32,8 @@ WantedSet ReadWanted(const char* szRunKey);
 // What a router keeps as the text of a rule's mappings: our mark, then the service's name or the rule's
 // number; plain ASCII, which every router keeps.
 std::string MappingDescription(const TAVO_PF_CONF* pRule);
+// The service that a rule is for, else the rule's number, as text for a user.
+std::string RuleTitle(const TAVO_PF_CONF* pRule);
 // A rule as text for a user, and fit to be a key of the status file: no separator, no end of line in it.
 std::string RuleName(const TAVO_PF_CONF* pRule);
 

@@ -15,6 +15,7 @@ namespace tavo {
 namespace {
 
 constexpr size_t kMaxDeletions = 256;  // of one run; each costs a listing
+constexpr size_t kMaxHolderText = 64;
 
 uint16_t Port(const Captures& captures, const char* szName, uint16_t nDefault) {
     const auto it = captures.find(szName);
@@ -39,23 +40,21 @@ std::vector<Refusal> Forwarder::Run(const std::vector<Job>& rgWanted) {
         mSession.Perform(kStepLogout);  // a router that does not let go of a session ends it by itself
         return mRgRefusals;
     }
-    for (const Job& job : rgWanted) {
-        Refuse(job.Text(), login.szWhy);
-    }
-    if (rgWanted.empty() && !mMade.Here().empty()) {
-        Refuse("earlier forwards", login.szWhy);
+    RefuseAll(rgWanted, login);
+    for (const MadeJob& made : mMade.Here()) {
+        if (std::none_of(rgWanted.begin(), rgWanted.end(), [&](const Job& job) { return made.job.IsSame(job); })) {
+            RefuseRemoval(made.job, login);
+        }
     }
     return mRgRefusals;
 }
 
 void Forwarder::Apply(const std::vector<Job>& rgWanted) {
-    std::string szWhy;
+    StepResult list;
     mBlListed = mOperations.Has(kStepList);
-    if (mBlListed && !List(szWhy)) {
-        Refuse("list of forwards", szWhy);
-        for (const Job& job : rgWanted) {
-            Refuse(job.Text(), szWhy);
-        }
+    if (mBlListed && !List(list)) {
+        RefuseRun("list of forwards", list);
+        RefuseAll(rgWanted, list);
         return;
     }
     if (mBlListed) {
@@ -71,24 +70,23 @@ void Forwarder::Apply(const std::vector<Job>& rgWanted) {
     const StepResult apply = mSession.Perform(kStepApply);
     for (const Job& job : rgWanted) {
         if (!apply.blDone && !IsRefused(job.Text())) {
-            Refuse(job.Text(), apply.szWhy);
+            Refuse(job, apply);
         }
     }
     if (!apply.blDone && rgWanted.empty()) {
-        Refuse("earlier forwards", apply.szWhy);
+        RefuseRun("earlier forwards", apply);
     }
     if (mBlListed) {
         Verify(rgWanted);
     }
 }
 
-bool Forwarder::List(std::string& szWhy) {
-    const StepResult list = mSession.Perform(kStepList);
+bool Forwarder::List(StepResult& list) {
+    list = mSession.Perform(kStepList);
     mRgEntries.clear();
     for (const Captures& captures : list.rgEntries) {
         mRgEntries.push_back(ReadEntry(captures));
     }
-    szWhy = list.szWhy;
     return list.blDone;
 }
 
@@ -133,7 +131,7 @@ void Forwarder::ForgetLost() {
 
 // One after the other with a new listing between: on many routers a deletion renumbers the entries.
 void Forwarder::RemoveUnwanted(const std::vector<Job>& rgWanted) {
-    std::string szWhy;
+    StepResult list;
     for (size_t i = 0; i < kMaxDeletions; ++i) {
         const auto it = std::find_if(mRgEntries.begin(), mRgEntries.end(), [&](const Entry& entry) {
             const bool blWanted =
@@ -145,8 +143,8 @@ void Forwarder::RemoveUnwanted(const std::vector<Job>& rgWanted) {
         }
         const Entry entry = *it;
         Delete(entry.job, entry.rgCaptures);
-        if (!List(szWhy)) {
-            Refuse("list of forwards", szWhy);
+        if (!List(list)) {
+            RefuseRun("list of forwards", list);
             return;
         }
     }
@@ -167,7 +165,7 @@ bool Forwarder::Delete(const Job& job, const Captures& captures) {
     }
     const StepResult result = mSession.Perform(blRange ? kStepDeleteRange : kStepDeletePort, values);
     if (!result.blDone) {
-        Refuse("removal of " + job.Text(), result.szWhy);
+        RefuseRemoval(job, result);
         return false;
     }
     mBlChanged = true;
@@ -182,8 +180,11 @@ void Forwarder::AddMissing(const std::vector<Job>& rgWanted) {
         if (std::any_of(mRgEntries.begin(), mRgEntries.end(), fnServes)) {
             continue;
         }
-        if (std::any_of(mRgEntries.begin(), mRgEntries.end(), fnClashes)) {
-            Refuse(job.Text(), "the router already forwards this port for something else");
+        const auto clash = std::find_if(mRgEntries.begin(), mRgEntries.end(), fnClashes);
+        if (clash != mRgEntries.end()) {
+            RefuseOwn(job, "the router already forwards this port for something else");
+            mRgRefusals.back().holder =
+                Holder{HarmlessText(clash->szClient, kMaxHolderText), HarmlessText(clash->job.szName, kMaxHolderText)};
             continue;
         }
         Add(job);
@@ -195,7 +196,7 @@ void Forwarder::Add(const Job& job) {
     // before stays so whatever the router says: its deletion may have failed.
     const bool blKnown = mMade.Holds(job, "");
     if (!mMade.Add(job)) {
-        Refuse(job.Text(), "the record of what was made cannot be written");
+        RefuseOwn(job, "the record of what was made cannot be written");
         return;
     }
     const StepResult result = mSession.Perform(job.IsRange() ? kStepAddRange : kStepAddPort, JobValues(job));
@@ -203,7 +204,7 @@ void Forwarder::Add(const Job& job) {
         mBlChanged = true;
         return;
     }
-    Refuse(job.Text(), result.szWhy);
+    Refuse(job, result);
     if (result.blAnswered && !blKnown) {
         mMade.Remove(job);
     }
@@ -211,16 +212,16 @@ void Forwarder::Add(const Job& job) {
 
 // A router's yes is not enough. A forward that could not be added or deleted has been named already.
 void Forwarder::Verify(const std::vector<Job>& rgWanted) {
-    std::string szWhy;
-    if (!List(szWhy)) {
-        Refuse("list of forwards", szWhy);
+    StepResult list;
+    if (!List(list)) {
+        RefuseRun("list of forwards", list);
         return;
     }
     for (const Job& job : rgWanted) {
         const bool blThere =
             std::any_of(mRgEntries.begin(), mRgEntries.end(), [&](const Entry& entry) { return Serves(entry, job); });
         if (!blThere && !IsRefused(job.Text())) {
-            Refuse(job.Text(), "the router said yes but does not list it");
+            RefuseOwn(job, "the router said yes but does not list it");
         }
     }
 }
@@ -240,8 +241,32 @@ std::string Forwarder::Word(const std::string& szProtocol) const {
     return szProtocol == "tcp" ? mOperations.szTcp : (szProtocol == "udp" ? mOperations.szUdp : mOperations.szBoth);
 }
 
-void Forwarder::Refuse(const std::string& szWhat, std::string szWhy) {
-    mRgRefusals.push_back({szWhat, std::move(szWhy)});
+void Forwarder::Refuse(const Job& job, const StepResult& result) {
+    mRgRefusals.push_back({job.Text(), result.szWhy, job, RefusalKind::kForward, result.enEnd == WebEnd::kAnswered});
+}
+
+// Before anything was changed: what an earlier run made may be there still.
+void Forwarder::RefuseAll(const std::vector<Job>& rgWanted, const StepResult& result) {
+    const std::vector<MadeJob> rgMade = mMade.Here();
+    for (const Job& job : rgWanted) {
+        Refuse(job, result);
+        if (std::any_of(rgMade.begin(), rgMade.end(), [&](const MadeJob& made) { return made.job.IsSame(job); })) {
+            mRgRefusals.back().blAnswered = false;
+        }
+    }
+}
+
+void Forwarder::RefuseRemoval(const Job& job, const StepResult& result) {
+    mRgRefusals.push_back(
+        {"removal of " + job.Text(), result.szWhy, job, RefusalKind::kRemoval, result.enEnd == WebEnd::kAnswered});
+}
+
+void Forwarder::RefuseRun(const char* szWhat, const StepResult& result) {
+    mRgRefusals.push_back({szWhat, result.szWhy, {}, RefusalKind::kRun, result.enEnd == WebEnd::kAnswered});
+}
+
+void Forwarder::RefuseOwn(const Job& job, const char* szWhy) {
+    mRgRefusals.push_back({job.Text(), szWhy, job});
 }
 
 bool Forwarder::IsRefused(const std::string& szWhat) const {

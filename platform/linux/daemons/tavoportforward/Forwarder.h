@@ -31,7 +31,7 @@ private:
     };
 
     void Apply(const std::vector<Job>& rgWanted);
-    bool List(std::string& szWhy);
+    bool List(StepResult& list);
     Entry ReadEntry(const Captures& captures) const;
     bool IsOwn(const Entry& entry) const;
     bool Serves(const Entry& entry, const Job& job) const;
@@ -44,7 +44,11 @@ private:
     void Verify(const std::vector<Job>& rgWanted);
     Values JobValues(const Job& job) const;
     std::string Word(const std::string& szProtocol) const;
-    void Refuse(const std::string& szWhat, std::string szWhy);
+    void Refuse(const Job& job, const StepResult& result);
+    void RefuseAll(const std::vector<Job>& rgWanted, const StepResult& result);
+    void RefuseRemoval(const Job& job, const StepResult& result);
+    void RefuseRun(const char* szWhat, const StepResult& result);
+    void RefuseOwn(const Job& job, const char* szWhy);
     bool IsRefused(const std::string& szWhat) const;
 
     Session& mSession;

@@ -49,12 +49,19 @@ public:
 private:
     void AddJob(Job job, const ProtocolSet& protocols);
     void Keep(Job job, const char* szProtocol, bool blTaken);
-    void Refuse(std::string szWhat, const char* szWhy) { mJobs.rgRefusals.push_back({std::move(szWhat), szWhy}); }
+    void Refuse(const Job& job, const char* szWhy) { mJobs.rgRefusals.push_back({job.Text(), szWhy, job}); }
+    void RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy);
 
     Page mPort;
     Page mRange;
     JobSet mJobs;
 };
+
+void Splitter::RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy) {
+    Job job;
+    job.szRule = RuleTitle(pRule);
+    mJobs.rgRefusals.push_back({RuleName(pRule), szWhy, job});
+}
 
 void Splitter::Add(const TAVO_PF_CONF* pRule) {
     const auto protocols = ParseProtocol(Value(pRule, "protocol name"));
@@ -62,7 +69,7 @@ void Splitter::Add(const TAVO_PF_CONF* pRule) {
     // One protocol is enough to pair the ports.
     const auto rgPairs = ExpandRule("tcp", Value(pRule, "r_port"), Value(pRule, "s_port"));
     if (!protocols || !rgRanges || !rgPairs) {
-        Refuse(RuleName(pRule), "its ports cannot be paired");
+        RefuseRule(pRule, "its ports cannot be paired");
         return;
     }
     size_t nPair = 0;
@@ -70,9 +77,9 @@ void Splitter::Add(const TAVO_PF_CONF* pRule) {
         const size_t nFirst = nPair;
         nPair += static_cast<size_t>(range.nLast - range.nFirst) + 1;
         const uint16_t nBoxFirst = (*rgPairs)[nFirst].nBoxPort;
-        const Job job{"", range.nFirst, range.nLast, nBoxFirst, MappingDescription(pRule)};
+        const Job job{"", range.nFirst, range.nLast, nBoxFirst, MappingDescription(pRule), RuleTitle(pRule)};
         if ((*rgPairs)[nPair - 1].nBoxPort - nBoxFirst != range.nLast - range.nFirst) {
-            Refuse(RuleName(pRule), "a range of router ports needs one range of the box's ports");
+            RefuseRule(pRule, "a range of router ports needs one range of the box's ports");
             continue;
         }
         AddJob(job, *protocols);
@@ -84,7 +91,7 @@ void Splitter::AddJob(Job job, const ProtocolSet& protocols) {
     const bool blBoth = protocols.blTcp && protocols.blUdp;
     if (!page.blThere) {
         job.szProtocol = blBoth ? "both" : (protocols.blTcp ? "tcp" : "udp");
-        Refuse(job.Text(), "the router has no page for this kind of forward");
+        Refuse(job, "the router has no page for this kind of forward");
     } else if (blBoth && page.blBoth) {
         Keep(job, "both", true);
     } else {
@@ -101,15 +108,15 @@ void Splitter::Keep(Job job, const char* szProtocol, bool blTaken) {
     const Page& page = job.IsRange() ? mRange : mPort;
     job.szProtocol = szProtocol;
     if (!blTaken) {
-        Refuse(job.Text(), "the router does not forward this protocol");
+        Refuse(job, "the router does not forward this protocol");
     } else if (!page.blChangePort && job.nRouterFirst != job.nBoxFirst) {
-        Refuse(job.Text(), "the router cannot forward to another port number");
+        Refuse(job, "the router cannot forward to another port number");
     } else if (std::none_of(mJobs.rgJobs.begin(), mJobs.rgJobs.end(),
                             [&](const Job& other) { return other.IsSame(job); })) {
         const bool blClash =
             std::any_of(mJobs.rgJobs.begin(), mJobs.rgJobs.end(), [&](const Job& other) { return other.Clashes(job); });
         if (blClash) {
-            Refuse(job.Text(), "another rule has asked for this port already");
+            Refuse(job, "another rule has asked for this port already");
         } else {
             mJobs.rgJobs.push_back(std::move(job));
         }

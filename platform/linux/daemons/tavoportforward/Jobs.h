@@ -4,9 +4,11 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
 
+#include "daemons/common/Outcome.h"
 #include "tavo/portforward.h"
 
 namespace tavo {
@@ -16,7 +18,8 @@ struct Job {
     uint16_t nRouterFirst = 0;
     uint16_t nRouterLast = 0;
     uint16_t nBoxFirst = 0;
-    std::string szName;  // as MappingDescription() makes it
+    std::string szName;       // as MappingDescription() makes it
+    std::string szRule = {};  // as the user named it
 
     bool IsRange() const { return nRouterFirst != nRouterLast; }
     uint16_t BoxLast() const { return static_cast<uint16_t>(nBoxFirst + (nRouterLast - nRouterFirst)); }
@@ -35,9 +38,19 @@ struct Job {
     }
 };
 
+enum class RefusalKind {
+    kForward,  // a forward, or a whole rule, that is not in place
+    kRemoval,  // what we made earlier is still there
+    kRun       // the run as a whole
+};
+
 struct Refusal {
     std::string szWhat;  // job or rule as a user reads it
     std::string szWhy;
+    Job job = {};  // no ports: it is about a whole rule, or about the run
+    RefusalKind enKind = RefusalKind::kForward;
+    bool blAnswered = true;             // false: the router did not answer, and nobody knows what it did
+    std::optional<Holder> holder = {};  // who has the port
 };
 
 struct JobSet {

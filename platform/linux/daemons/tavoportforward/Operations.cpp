@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <charconv>
 #include <functional>
+#include <set>
 #include <string_view>
 
 #include "core/TextFile.h"
@@ -65,12 +66,14 @@ std::string Suffix(const std::string& szKey, const char* szWord) {
     return szKey.starts_with(szStart) ? szKey.substr(szStart.size()) : "";
 }
 
+// False for an expression that cannot be read, or has no group to take.
 bool TakePattern(const std::string& szValue, const std::function<void(Pattern)>& fnKeep) {
     std::optional<Pattern> pattern = Pattern::Compile(szValue);
-    if (pattern) {
-        fnKeep(std::move(*pattern));
+    if (!pattern || pattern->Groups().empty()) {
+        return false;
     }
-    return pattern.has_value();
+    fnKeep(std::move(*pattern));
+    return true;
 }
 
 bool ReadNumberedKey(Operation& operation, const std::string& szKey, const std::string& szValue) {
@@ -115,7 +118,8 @@ bool ReadKey(Operation& operation, const std::string& szKey, const std::string& 
     }
     if (szKey == "entry") {
         return operation.szStep == kStepList &&
-               TakePattern(szValue, [&](Pattern entry) { operation.entry = std::move(entry); });
+               TakePattern(szValue, [&](Pattern entry) { operation.entry = std::move(entry); }) &&
+               operation.entry->Groups().contains("router_first") && operation.entry->Groups().contains("protocol");
     }
     return ReadNumberedKey(operation, szKey, szValue);
 }
@@ -187,6 +191,66 @@ bool ReadStep(Operations& operations, const TAVO_PF_CONF* pSection, std::string&
     return true;
 }
 
+using Names = std::set<std::string>;
+
+// The names that have a value when a step begins. What login and list took is there later on; what an addition or
+// a deletion took is there when the run ends.
+Names KnownAt(const std::string& szStep, const Operations& operations) {
+    Names known = {"user", "pass", "gateway", "url", "box"};
+    const bool blDeletion = szStep == kStepDeletePort || szStep == kStepDeleteRange;
+    if (blDeletion || szStep == kStepAddPort || szStep == kStepAddRange) {
+        known.insert({"protocol", "router_first", "router_last", "box_first", "box_last", "name"});
+    }
+    const bool blEnding = szStep == kStepApply || szStep == kStepLogout;
+    for (const Operation& operation : operations.rgOperations) {
+        const bool blBefore =
+            operation.szStep == kStepLogin || (operation.szStep == kStepList && szStep != kStepLogin) || blEnding;
+        for (const auto& [szName, pattern] : operation.rgTakes) {
+            if (blBefore && operation.szStep != szStep) {
+                known.insert(szName);
+            }
+        }
+        if (blDeletion && operation.entry) {
+            known.merge(operation.entry->Groups());
+        }
+    }
+    return known;
+}
+
+// The name between braces that the operation uses and that has no value then; empty when there is none.
+std::string MissingName(const Operation& operation, const Names& known) {
+    Values values;
+    for (const std::string& szName : known) {
+        values[szName];
+    }
+    std::string szMissing;
+    FillIn(operation.szPath, values, Encoding::kUrl, szMissing);
+    FillIn(operation.szBody.value_or(""), values, Encoding::kUrl, szMissing);
+    for (const auto& [szName, szValue] : operation.rgHeaders) {
+        FillIn(szValue, values, Encoding::kHeader, szMissing);
+    }
+    return szMissing;
+}
+
+bool HaveValues(const Operations& operations, std::string& szWhy) {
+    for (const char* szStep : kSteps) {
+        Names known = KnownAt(szStep, operations);
+        for (const Operation& operation : operations.rgOperations) {
+            if (operation.szStep != szStep) {
+                continue;
+            }
+            if (const std::string szMissing = MissingName(operation, known); !szMissing.empty()) {
+                szWhy = "nothing stands for {" + szMissing + "} in [" + szStep + "]";
+                return false;
+            }
+            for (const auto& [szName, pattern] : operation.rgTakes) {
+                known.insert(szName);
+            }
+        }
+    }
+    return true;
+}
+
 std::string UrlEncoded(std::string_view szText) {
     static constexpr char kHex[] = "0123456789ABCDEF";
     static constexpr std::string_view kPlain = "-._~";
@@ -238,6 +302,9 @@ std::optional<Operations> ReadOperations(const TAVO_PF_CONF* pSections, std::str
     }
     if (!operations.Has(kStepAddPort) || !operations.Has(kStepDeletePort)) {
         szWhy = "[PF add port] or [PF delete port] is missing";
+        return std::nullopt;
+    }
+    if (!HaveValues(operations, szWhy)) {
         return std::nullopt;
     }
     return operations;

@@ -50,6 +50,19 @@ std::optional<Pattern> Pattern::Compile(const std::string& szExpression) {
     return Pattern(std::move(pCode));
 }
 
+std::set<std::string> Pattern::Groups() const {
+    uint32_t nGroups = 0;
+    pcre2_pattern_info(mPCode->pCode.get(), PCRE2_INFO_CAPTURECOUNT, &nGroups);
+    std::set<std::string> setNames;
+    for (uint32_t i = 1; i <= nGroups; ++i) {
+        setNames.insert(std::to_string(i));
+    }
+    for (const auto& [nGroup, szName] : mPCode->mapNames) {
+        setNames.insert(szName);
+    }
+    return setNames;
+}
+
 std::optional<std::vector<Captures>> Pattern::FindAll(const std::string& szText, size_t nMost) const {
     const std::unique_ptr<pcre2_match_context, Pcre2Free> pContext(pcre2_match_context_create(nullptr));
     const std::unique_ptr<pcre2_match_data, Pcre2Free> pData(

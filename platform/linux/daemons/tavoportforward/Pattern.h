@@ -6,6 +6,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -19,6 +20,9 @@ class Pattern {
 public:
     // Nothing for an expression that cannot be read.
     static std::optional<Pattern> Compile(const std::string& szExpression);
+
+    // The groups as FindAll() calls them: all numbers, and the names of those that have one.
+    std::set<std::string> Groups() const;
 
     // All matches from left to right, nMost at most. Nothing when a match went beyond its bounds.
     std::optional<std::vector<Captures>> FindAll(const std::string& szText, size_t nMost) const;

@@ -76,11 +76,13 @@ bool Session::PerformOne(const Operation& operation, const Values& values, StepR
     }
     request.szPath = std::move(*szPath);
     if (mNSilent >= kSilentLimit) {
+        result.enEnd = mEnTrouble;
         return Fail(result, "the router has stopped answering");
     }
     const WebAnswer answer = mClient.Send(request);
     mNSilent = answer.enEnd == WebEnd::kAnswered ? 0 : mNSilent + 1;
     if (answer.enEnd != WebEnd::kAnswered) {
+        result.enEnd = mEnTrouble = answer.enEnd;
         result.blAnswered = answer.enEnd == WebEnd::kUnreachable;
         return Fail(result, std::string(EndText(answer.enEnd)) + " (step \"" + operation.szStep + "\")");
     }

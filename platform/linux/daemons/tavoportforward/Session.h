@@ -17,6 +17,7 @@ struct StepResult {
     bool blWasGone = false;  // a deletion that found nothing to delete
     std::string szWhy;       // of a step that was not done
     std::vector<Captures> rgEntries;
+    WebEnd enEnd = WebEnd::kAnswered;  // of the request that failed
 };
 
 class Session {
@@ -26,6 +27,8 @@ public:
 
     // All requests of one step; done when the file has none of it. values join those of the session.
     StepResult Perform(const std::string& szStep, const Values& values = {});
+    // How the last request that got no answer ended.
+    WebEnd LastTrouble() const { return mEnTrouble; }
 
 private:
     bool PerformOne(const Operation& operation, const Values& values, StepResult& result);
@@ -35,7 +38,8 @@ private:
     WebClient& mClient;
     const Operations& mOperations;
     int mNSilent = 0;  // requests in a row without an answer
-    Values mValues;    // account, addresses, and what earlier answers gave
+    WebEnd mEnTrouble = WebEnd::kAnswered;
+    Values mValues;  // account, addresses, and what earlier answers gave
 };
 
 }  // namespace tavo

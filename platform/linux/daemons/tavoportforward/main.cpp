@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <syslog.h>
 
+#include <algorithm>
 #include <charconv>
 #include <chrono>
 #include <cstdio>
@@ -16,10 +17,11 @@
 
 #include "core/Descriptor.h"
 #include "core/TextFile.h"
+#include "daemons/tavoportforward/Description.h"
 #include "daemons/tavoportforward/Forwarder.h"
+#include "daemons/tavoportforward/Telling.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterScript.h"
-#include "tavo/log.h"
 #include "tavo/net.h"
 
 namespace {
@@ -31,11 +33,13 @@ using tavo::Value;
 constexpr char kHelp[] =
     "Usage: tavoportforward [--version | --check FILE... | --help]\n"
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
-    "web pages that its description knows (/etc.defaults/portforward/routerdb), with the account that\n"
-    "/etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks for.\n"
+    "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
+    "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
+    "for: /var/lib/tavo/manual_router.made remembers it, and is the only memory of a router that shows no list.\n"
+    "What became of each port stands in /run/tavo/tavoportforward.json.\n"
     "\n"
     "  --version   the version of the operations syntax that this tool understands\n"
-    "  --check     says of router.ops files whether they can be performed\n"
+    "  --check     says of router.ops and router.des (by that ending) files what is wrong with them\n"
     "  --help      this text\n"
     "\n"
     "Exit status: 0 all is in place (or good); 1 some forwards are not (see the system log\n"
@@ -43,9 +47,6 @@ constexpr char kHelp[] =
 constexpr char kLock[] = "/var/run/tavoportforward.lock";
 constexpr auto kRunLimit = std::chrono::seconds(180);  // well below the five minutes that a save waits
 constexpr int kAddressSize = 64;
-constexpr int kErrorLevel = 3;
-constexpr int kSystemEvents = 1;
-constexpr size_t kMaxText = 1000;
 
 enum Status : int { kAllInPlace = 0, kSomeMissing = 1, kUsage = 2, kNotTried = 3 };
 
@@ -57,18 +58,16 @@ struct ScriptDeleter {
 struct KnownRouter {
     std::string szGateway;
     std::string szBox;
+    bool blNoGateway = false;
     tavo::WebRouter web;
     ConfList pDescription;
     tavo::Operations operations;
 };
 
-int NotTried(const std::string& szWhy) {
-    syslog(LOG_ERR, "nothing was tried: %s", szWhy.c_str());
-    const ConfList pRules(TAVOPFRuleGet());
-    if (!pRules || TLIBPFCountRuleConf(pRules.get(), 1) != 0) {  // else there was nothing to try either
-        TAVOLogSet1(kSystemEvents, kErrorLevel, TAVO_EVENT_PF_ADD_FAILED, "all", ("(" + szWhy + ")").c_str(), nullptr,
-                    nullptr);
-    }
+int NotTried(const std::string& szWhy, const KnownRouter& router = {}) {
+    tavo::RunResult result{router.szGateway, router.szBox};
+    result.enRouter = router.blNoGateway ? tavo::RouterState::kNoGateway : tavo::RouterState::kNotAsked;
+    tavo::TellNotTried(std::move(result), szWhy);
     return kNotTried;
 }
 
@@ -84,6 +83,7 @@ bool FindAddresses(KnownRouter& router, std::string& szWhy) {
     if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0 ||
         TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) != 0) {
         szWhy = "this box has no default gateway";
+        router.blNoGateway = true;
         return false;
     }
     router.szGateway = router.web.szAddress = szGateway;
@@ -144,25 +144,23 @@ bool Load(KnownRouter& router, std::string& szWhy) {
     return false;
 }
 
-// One log line each, and one event for each reason.
-void Report(const std::vector<Refusal>& rgRefusals) {
-    std::vector<std::pair<std::string, std::string>> rgEvents;  // reason, what it holds for
-    for (const auto& [szWhat, szWhy] : rgRefusals) {
-        syslog(LOG_ERR, "%s: %s", szWhat.c_str(), szWhy.c_str());
-        auto it = rgEvents.begin();
-        while (it != rgEvents.end() && it->first != szWhy) {
-            ++it;
-        }
-        if (it == rgEvents.end()) {
-            rgEvents.emplace_back(szWhy, szWhat);
-        } else if (it->second.size() < kMaxText) {
-            it->second += ", " + szWhat;
-        }
+tavo::RouterState StateAfter(tavo::WebEnd enTrouble) {
+    switch (enTrouble) {
+        case tavo::WebEnd::kTimeout:
+            return tavo::RouterState::kSilent;
+        case tavo::WebEnd::kUnreachable:
+            return tavo::RouterState::kUnreachable;
+        default:
+            return tavo::RouterState::kOk;
     }
-    for (const auto& [szWhy, szWhat] : rgEvents) {
-        TAVOLogSet1(kSystemEvents, kErrorLevel, TAVO_EVENT_PF_ADD_FAILED, szWhat.c_str(), ("(" + szWhy + ")").c_str(),
-                    nullptr, nullptr);
-    }
+}
+
+// Why the router as a whole is not as it should be: the run's own trouble, or one reason for all that was asked.
+std::string RouterWhy(const std::vector<Refusal>& rgRefusals) {
+    const auto itRun = std::find_if(rgRefusals.begin(), rgRefusals.end(), [](const Refusal& refusal) {
+        return refusal.enKind == tavo::RefusalKind::kRun || !refusal.blAnswered;
+    });
+    return itRun == rgRefusals.end() ? "" : itRun->szWhy;
 }
 
 int Run() {
@@ -173,11 +171,11 @@ int Run() {
     KnownRouter router;
     std::string szWhy;
     if (!Load(router, szWhy)) {
-        return NotTried(szWhy);
+        return NotTried(szWhy, router);
     }
-    const tavo::JobSet jobs = tavo::ReadJobs(router.pDescription.get());
+    tavo::JobSet jobs = tavo::ReadJobs(router.pDescription.get());
     if (!jobs.blReadable) {
-        return NotTried("the rules cannot be read");
+        return NotTried("the rules cannot be read", router);
     }
     tavo::WebClient client(router.web, std::chrono::steady_clock::now() + kRunLimit);
     tavo::Session session(client, router.operations,
@@ -187,10 +185,14 @@ int Run() {
                            {"url", router.web.Url()},
                            {"box", router.szBox}});
     tavo::MadeJobs made(router.szGateway, router.szBox);
-    std::vector<Refusal> rgRefusals = tavo::Forwarder(session, router.operations, made, router.szBox).Run(jobs.rgJobs);
-    rgRefusals.insert(rgRefusals.end(), jobs.rgRefusals.begin(), jobs.rgRefusals.end());
-    Report(rgRefusals);
-    return rgRefusals.empty() ? kAllInPlace : kSomeMissing;
+    tavo::RunResult result{router.szGateway, router.szBox};
+    result.rgRefusals = tavo::Forwarder(session, router.operations, made, router.szBox).Run(jobs.rgJobs);
+    result.enRouter = StateAfter(session.LastTrouble());
+    result.szRouterWhy = RouterWhy(result.rgRefusals);
+    result.rgRefusals.insert(result.rgRefusals.end(), jobs.rgRefusals.begin(), jobs.rgRefusals.end());
+    result.rgWanted = std::move(jobs.rgJobs);
+    tavo::Tell(result);
+    return result.rgRefusals.empty() ? kAllInPlace : kSomeMissing;
 }
 
 int Check(char** pszPaths) {
@@ -198,7 +200,10 @@ int Check(char** pszPaths) {
     for (; *pszPaths != nullptr; ++pszPaths) {
         std::string szWhy = "no sectioned file, or an empty one";
         const ConfList pSections = tavo::LoadConfList(*pszPaths);
-        if (!pSections || !tavo::ReadOperations(pSections.get(), szWhy)) {
+        const bool blDescription = std::string_view(*pszPaths).ends_with(".des");
+        const bool blGood = pSections && (blDescription ? tavo::IsGoodDescription(pSections.get(), szWhy)
+                                                        : tavo::ReadOperations(pSections.get(), szWhy).has_value());
+        if (!blGood) {
             std::printf("%s: %s\n", *pszPaths, szWhy.c_str());
             nStatus = kSomeMissing;
         }
