@@ -427,7 +427,7 @@ class Tool(unittest.TestCase):
             put(path, "x\n")
         put("/usr/tavo/bin/curl", "#!/bin/sh\nexit 22\n")
         os.chmod("/usr/tavo/bin/curl", 0o755)
-        self.expect("report", FAILED, r"did not take it(?s:.)*stays in /tmp/Acme_\d+\.tgz", **known)
+        self.expect("report", FAILED, r"no server is named(?s:.)*stays in /tmp/Acme_\d+\.tgz", **known)
         put("/usr/tavo/bin/curl", "#!/bin/sh\n")
         told = self.json("report", **known)[1]
         self.assertTrue(os.path.exists(told["archive"]), told)
