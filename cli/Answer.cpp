@@ -10,6 +10,8 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "Table.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -48,8 +50,10 @@ bool IsHarmful(uint32_t nCode) {
            nCode == 0xfeff;
 }
 
-std::string Complaint(const char* szWord, Ink enInk, const std::string& szText) {
-    return Paint(enInk, szWord, STDERR_FILENO) + ": " + szText + "\n";
+std::string Complaint(const std::string& szWord, Ink enInk, const std::string& szText) {
+    // The word is painted after the lines are broken, for which it must have its own width.
+    const std::string szLines = Wrap(szWord + ": " + szText, WidthOf(STDERR_FILENO));
+    return Paint(enInk, szWord, STDERR_FILENO) + szLines.substr(szWord.size()) + "\n";
 }
 
 bool Write(FILE* pStream, const std::string& szText) {
@@ -76,7 +80,7 @@ int Print(const Reply& reply, bool blJson) {
     const bool blWell = reply.enExit == kOk;
     std::string szOut = reply.szBody;
     if (blWell && !reply.szMessage.empty()) {
-        szOut += reply.szMessage + "\n";
+        szOut += Wrap(reply.szMessage, WidthOf(STDOUT_FILENO)) + "\n";
     }
     const bool blWritten = Write(stdout, szOut);
     std::string szComplaints;
@@ -122,15 +126,14 @@ std::string Paint(Ink enInk, const std::string& szText, int fd) {
 }
 
 std::string Columns(const std::vector<std::pair<std::string, std::string>>& rgLines) {
-    size_t nWidth = 0;
+    size_t nLabel = 0;
     for (const auto& [szLabel, szValue] : rgLines) {
-        nWidth = std::max(nWidth, szLabel.size());
+        nLabel = std::max(nLabel, CellsOf(szLabel));
     }
     std::string szText;
+    const size_t nWidth = WidthOf(STDOUT_FILENO);
     for (const auto& [szLabel, szValue] : rgLines) {
-        if (!szValue.empty()) {
-            szText += fmt::format("{:<{}}  {}\n", szLabel, nWidth, szValue);
-        }
+        szText += szValue.empty() ? "" : Hang(fmt::format("{:<{}}  ", szLabel, nLabel), szValue, nWidth) + "\n";
     }
     return szText;
 }

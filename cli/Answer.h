@@ -1,6 +1,6 @@
 // What a command answers and how it is shown. Relies on jsoncpp and fmt. Promises: one answer per run, and
 // with --json exactly one document on standard output; no text that came from a router or a file reaches
-// a terminal with its control characters; escape sequences only on a terminal.
+// a terminal with its control characters; escape sequences only on a terminal, whose width the text keeps to.
 #pragma once
 
 #include <json/json.h>
@@ -11,7 +11,7 @@
 
 namespace tavo::cli {
 
-enum Exit : int { kOk = 0, kFailed = 1, kUsage = 2, kBusy = 3, kRefused = 4, kTooMany = 5 };
+enum Exit : int { kOk = 0, kFailed = 1, kUsage = 2, kBusy = 3, kRefused = 4, kTooMany = 5, kAway = 6 };
 
 struct Reply {
     Exit enExit = kOk;
@@ -34,7 +34,8 @@ bool IsSmartTerminal(int fd);
 // szText in this colour where fd takes colour and NO_COLOR is not set.
 std::string Paint(Ink enInk, const std::string& szText, int fd);
 
-// "label    value" lines with the values one below the other; lines without a value are left out.
+// "label    value" lines with the values one below the other, for standard output; lines without a value are left
+// out.
 std::string Columns(const std::vector<std::pair<std::string, std::string>>& rgLines);
 
 }  // namespace tavo::cli

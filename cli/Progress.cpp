@@ -1,27 +1,20 @@
-// Draws progress. Relies on the terminal's width and "erase to the end of the line". Promises: see
-// Progress.h.
+// Draws progress. Relies on the terminal's width and "erase to the end of the line". Promises: see Progress.h.
 #include "Progress.h"
 
 #include <fmt/format.h>
-#include <sys/ioctl.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
 
 #include "Answer.h"
+#include "Table.h"
 
 namespace tavo::cli {
 
 namespace {
 
 constexpr int kBarCells = 20;
-constexpr size_t kUsualWidth = 80;
-
-size_t Width() {
-    winsize size = {};
-    return ioctl(STDERR_FILENO, TIOCGWINSZ, &size) == 0 && size.ws_col > 0 ? size.ws_col : kUsualWidth;
-}
 
 }  // namespace
 
@@ -49,7 +42,7 @@ void Progress::Show(int nPercent, const std::string& szStep) {
         const std::string szLine =
             fmt::format("[{:#<{}}{:{}}] {:>3} %  {}", "", nDone, "", kBarCells - nDone, nPercent, szStep);
         // A line that wraps could not be redrawn.
-        fmt::print(stderr, "\r{}\x1b[K", szLine.substr(0, Width() - 1));
+        fmt::print(stderr, "\r{}\x1b[K", szLine.substr(0, WidthOf(STDERR_FILENO) - 1));
         mBlOpen = true;
     } else {
         fmt::print(stderr, "{:>3} %  {}\n", nPercent, szStep);

@@ -5,6 +5,8 @@
 
 #include <algorithm>
 
+#include "Table.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -42,11 +44,6 @@ std::vector<std::string> LoggedWords(const std::string& szLog) {
 std::string PortWords(const PortVerdict& verdict) {
     const std::string szPorts = verdict.szRouterPorts + "/" + verdict.szProtocol;
     return Clean(verdict.szBoxPorts == verdict.szRouterPorts ? szPorts : szPorts + " to " + verdict.szBoxPorts);
-}
-
-std::string TableRow(const std::string& szRule, const std::string& szPort, const std::string& szVerdict,
-                     const std::string& szReason) {
-    return fmt::format("{:<16} {:<20} {:<10}  {}\n", szRule, szPort, szVerdict, szReason);
 }
 
 Json::Value ToJson(const PortVerdict& verdict) {
@@ -93,16 +90,16 @@ void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) 
 void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply) {
     bool blClosed = false, blUnjudged = false, blNoJudge = false;
     reply.jsAnswer["ports"] = Json::arrayValue;
-    reply.szBody +=
-        rgVerdicts.empty() ? "" : Paint(Ink::kBold, TableRow("rule", "port", "verdict", "reason"), STDOUT_FILENO);
+    Table table({"rule", "port", "verdict", "reason"});
     for (const PortVerdict& verdict : rgVerdicts) {
         const std::string szRule = verdict.szRule + (verdict.szRule.empty() ? "" : " ") + verdict.szName;
-        reply.szBody += TableRow(Clean(szRule), PortWords(verdict), StatusWord(verdict.enStatus), verdict.szReason);
+        table.Add({Clean(szRule), PortWords(verdict), StatusWord(verdict.enStatus), verdict.szReason});
         reply.jsAnswer["ports"].append(ToJson(verdict));
         blClosed = blClosed || verdict.enStatus == kClosed;
         blUnjudged = blUnjudged || verdict.enStatus == kNotTested;
         blNoJudge = blNoJudge || verdict.szReason == kNoJudge;
     }
+    reply.szBody += table.ToText();
     if (blNoJudge) {
         reply.rgszWarnings.emplace_back(kAdviceNoJudge);
     }

@@ -7,6 +7,7 @@
 
 #include "Box.h"
 #include "Commands.h"
+#include "Table.h"
 #include "tavo/portforward.h"
 
 namespace tavo::cli {
@@ -28,13 +29,9 @@ bool Matches(const __tag_TAVO_ROUTERDB_LIST& model, const std::vector<std::strin
     });
 }
 
-std::string TableRow(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
-    return fmt::format("{:<20} {:<30} {}\n", szBrand, szModel, szVersion);
-}
-
-void AddModel(const __tag_TAVO_ROUTERDB_LIST& model, Reply& reply) {
-    reply.szBody += TableRow(Clean(model.szBrand), Clean(model.szModel),
-                             Clean(model.szVersion) + (model.blGeneric != 0 ? " (any version)" : ""));
+void AddModel(const __tag_TAVO_ROUTERDB_LIST& model, Table& table, Reply& reply) {
+    table.Add({Clean(model.szBrand), Clean(model.szModel),
+               Clean(model.szVersion) + (model.blGeneric != 0 ? " (any version)" : "")});
     Json::Value js;
     js["brand"] = model.szBrand;
     js["model"] = model.szModel;
@@ -54,15 +51,18 @@ Reply List(const std::vector<std::string>& rgszWords) {
     const ModelList pModels(pList, fnFree);
     Reply reply;
     reply.jsAnswer["routers"] = Json::arrayValue;
+    Table table({"brand", "model", "version"});
     int nModels = 0;
     for (const auto* pModel = pList; pModel != nullptr; pModel = pModel->pNext, ++nModels) {
         if (Matches(*pModel, rgszWords)) {
-            AddModel(*pModel, reply);
+            AddModel(*pModel, table, reply);
         }
     }
+    reply.szBody = table.ToText();
     if (!reply.szBody.empty()) {
-        reply.szBody = Paint(Ink::kBold, TableRow("brand", "model", "version"), STDOUT_FILENO) + reply.szBody;
-    } else if (nModels == 0) {
+        return reply;
+    }
+    if (nModels == 0) {
         reply.szMessage =
             "no router descriptions are installed. Your own go to /etc/tavo/routerdb; 'tavoportmap routers --update' "
             "fetches those of the server that database_url in /etc/tavo/platform.conf names";

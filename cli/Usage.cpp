@@ -3,14 +3,19 @@
 #include "Usage.h"
 
 #include <fmt/format.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <charconv>
 #include <numeric>
 
+#include "Table.h"
+
 namespace tavo::cli {
 
 namespace {
+
+constexpr size_t kPageWidth = 80;  // of a help text that goes into a file, or a pager
 
 enum class Kind { kNone, kCommand, kOption, kWord };
 
@@ -137,7 +142,7 @@ Reply Unknown(const std::string& szWhat, const std::string& szList, const std::s
 
 Reply MissingCommand(const CLI::App& app) {
     const std::string szName = FullName(app);
-    const std::string szHelp = app.help(app.get_parent() == nullptr ? "" : "tavoportmap");
+    const std::string szHelp = HelpText(app);
     Reply reply{.enExit = kUsage,
                 .szMessage = fmt::format("{} needs a command: {}", szName.empty() ? "tavoportmap" : "'" + szName + "'",
                                          Join(CommandNames(app))),
@@ -150,6 +155,11 @@ Reply MissingCommand(const CLI::App& app) {
 }
 
 }  // namespace
+
+std::string HelpText(const CLI::App& app) {
+    const size_t nWidth = WidthOf(STDOUT_FILENO);
+    return Wrap(app.help(app.get_parent() == nullptr ? "" : "tavoportmap"), nWidth == 0 ? kPageWidth : nWidth);
+}
 
 Reply ExplainUsage(const CLI::App& app, int argc, const char* const* argv, const CLI::ParseError& error) {
     const Understood understood = Understand(app, argc, argv);

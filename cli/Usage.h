@@ -10,6 +10,9 @@
 
 namespace tavo::cli {
 
+// The help of a command, for the terminal that it is read at.
+std::string HelpText(const CLI::App& app);
+
 // What to tell a user whose arguments could not be read.
 Reply ExplainUsage(const CLI::App& app, int argc, const char* const* argv, const CLI::ParseError& error);
 

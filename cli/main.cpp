@@ -22,6 +22,8 @@ constexpr char kFooter[] =
     "standard output: \"ok\", \"message\", \"warnings\" and what the command has to say.\n"
     "Files, the meaning of each status and what to do: man tavoportmap\n";
 
+constexpr size_t kHelpColumn = 24;  // where the explanations of a help text begin
+
 bool AsksForJson(int argc, char** argv) {
     for (int i = 1; i < argc && std::string_view(argv[i]) != "--"; ++i) {
         if (std::string_view(argv[i]) == "--json") {
@@ -33,14 +35,15 @@ bool AsksForJson(int argc, char** argv) {
 
 // The help of the command that the arguments name.
 Reply Help(const CLI::App& app) {
-    Reply reply{.szBody = app.help()};
-    reply.jsAnswer["help"] = app.help();
+    Reply reply{.szBody = HelpText(app)};
+    reply.jsAnswer["help"] = reply.szBody;
     return reply;
 }
 
 Reply Answer(int argc, char** argv, Request& request) {
     CLI::App app("Gets this box's ports through the router in front of it.", "tavoportmap");
     app.footer(kFooter);
+    app.get_formatter()->column_width(kHelpColumn);
     app.require_subcommand(1);
     app.set_help_flag("-h,--help", "print this help");
     app.set_version_flag("--version", "tavoportmap " TAVO_VERSION, "print the version");

@@ -190,6 +190,28 @@ class Tool(unittest.TestCase):
         for environment, coloured in (({}, True), ({"NO_COLOR": "1"}, False), ({"TERM": "dumb"}, False)):
             self.assertEqual("\x1b[1m" in on_terminal("rules", "list", **environment)[1], coloured, environment)
 
+    def test_no_line_is_wider_than_its_terminal_and_no_word_is_lost(self):
+        describe("Alderman", "Homestead \u4e2d\u6587 2 with a long name that goes on", "1.0")
+        tool("rules", "add", "a name longer than a narrow terminal is wide, and some", "--router-port", "80,443,8000-8010")
+        tool("rules", "add", "web", "--router-port", "443", "--box-port", "8443", "--force")
+        world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": "0 0 5 2 2 0 -1 10 80", "TAVO_REACH": "2 3 " + "0 NOLISTEN " * 12}
+        wide = lambda text: sum(1 + (char >= "\u1100") for char in text)
+        for width in (40, 80):
+            for arguments in ((), ("rules", "add", "--help"), ("routers",), ("test",), ("detect",), ("status",), ("rulse",)):
+                text = on_terminal(*arguments, COLUMNS=str(width), NO_COLOR="1", **world)[1].replace("\r\n", "\n")
+                text = text.split("\x1b[K\n")[-1]  # what the bar drew is no text
+                for line in text.split("\n"):
+                    # A command stays in one piece, to be copied; so does what has no blank to break it at.
+                    if " " in line.strip() and not re.match(r"  +tavoportmap |      --", line):
+                        self.assertLessEqual(wide(line), width, (arguments, line))
+                run = subprocess.run([TOOL, *arguments], text=True, capture_output=True, env={**os.environ, **world})
+                whole = re.sub(r"(?m)^ *\d+ %.*\n", "", run.stdout + run.stderr)
+                words = lambda text: [word for word in re.sub(r"[\s,]+", " ", text).split() if not word.endswith("...")]
+                self.assertFalse(set(words(text)) - set(words(whole)), arguments)
+                self.assertLess(len(set(words(whole)) - set(words(text))), 8, arguments)  # of a name that was cut
+                for line in run.stdout.split("\n") if arguments == ("test",) else []:
+                    self.assertRegex(line, r"^$|^rule |^[12] .* (80\d\d|80|443)/tcp ")  # a row a line, for scripts
+
     def test_a_held_lock_is_told_apart(self):
         tool("rules", "add", "--router-port", "80")
         put(ROUTER, KNOWN % ("yes", "no"))
