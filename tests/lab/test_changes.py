@@ -298,6 +298,26 @@ class Hooks(unittest.TestCase):
         self.assertIn(f"{HOOKS}: others than root may change it", self.try_hooks().stderr)
         self.assertEqual(len(LAB.read("/tmp/ran").splitlines()), 3)
 
+    def test_the_examples_pass_hostile_texts_on_as_texts(self):
+        for program in ("/usr/local/bin/curl", "/usr/sbin/sendmail"):
+            LAB.write(program, "#!/bin/sh\n{ printf '%s|' \"${0##*/}\" \"$@\"; cat; echo; } >>/tmp/called\n")
+            os.chmod(program, 0o755)
+        for name in ("mail", "push", "dynamic-dns"):
+            hook(name, LAB.read(f"{HERE}/../../packaging/hooks.d/{name}"))
+        text = f"@/etc/passwd {HOSTILE}"
+        self.assertEqual(self.try_hooks("TAVO_EVENT=port-lost", f"TAVO_TEXT={text}").returncode, 0)
+        mail, push = LAB.read("/tmp/called").split("curl|")
+        self.assertTrue(mail.startswith("sendmail|-i|root|To: root\nSubject: ") and mail.endswith(f"\n\n{text}\n\n"), mail)
+        self.assertIn(f"|--data-raw|{text}|https://push.example/", push)
+        os.unlink(f"{HOOKS}/mail")
+        for outside, status in (("203.0.113.5", 0), ("1.2.3.4&host=x", 1), ("", 1)):
+            os.unlink("/tmp/called")
+            done = self.try_hooks("TAVO_EVENT=address-changed", f"TAVO_OUTSIDE={outside}")
+            self.assertEqual((done.returncode, os.path.exists("/tmp/called")), (status, status == 0), done.stderr)
+            self.assertTrue(status or 'myip=203.0.113.5|user = "me:secret"' in LAB.read("/tmp/called"))
+            LAB.write("/tmp/called", "")
+        self.assertFalse(os.path.exists("/tmp/harm"))
+
     def test_a_hook_that_hangs_holds_up_neither_passes_nor_a_stop_and_is_ended(self):
         hook("10-hangs", "#!/bin/sh\necho $$ >/tmp/hanging\ntrap '' TERM\nsleep 1000 & echo $! >>/tmp/hanging\nwait\n"
                          "while :; do sleep 1; done\n")

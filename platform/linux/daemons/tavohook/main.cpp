@@ -7,6 +7,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cstdio>
 #include <set>
@@ -100,6 +101,18 @@ int Runner::Follow() {
     return 0;
 }
 
+// What is given, and what every hook may count on.
+std::vector<std::string> TryFacts(std::vector<std::string> rgFacts) {
+    for (const std::string szFact : {"TAVO_EVENT=test", "TAVO_TEXT=This is only a test."}) {
+        const std::string szName = szFact.substr(0, szFact.find('=') + 1);
+        if (std::none_of(rgFacts.begin(), rgFacts.end(),
+                         [&](const std::string& szGiven) { return szGiven.starts_with(szName); })) {
+            rgFacts.push_back(szFact);
+        }
+    }
+    return rgFacts;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -111,9 +124,7 @@ int main(int argc, char** argv) {
     }
     if (szVerb == "--try") {
         openlog("tavohook", LOG_PERROR, LOG_DAEMON);
-        std::vector<std::string> rgFacts = {"TAVO_EVENT=test", "TAVO_TEXT=This is only a test."};
-        rgFacts.insert(rgFacts.end(), argv + 2, argv + argc);
-        return Runner().RunAll(rgFacts);
+        return Runner().RunAll(TryFacts({argv + 2, argv + argc}));
     }
     std::fputs(kHelp, szVerb == "--help" ? stdout : stderr);
     return szVerb == "--help" ? 0 : kExitUsage;
