@@ -108,7 +108,10 @@ void PublishRun(const RunResult& result) {
     state.enRouter = result.enRouter;
     state.szRouterWhy = result.szRouterWhy;
     state.rgOutcomes = Outcomes(result);
-    NoteSince({}, state);
+    state.nRouterSince = state.nAt;
+    for (Outcome& outcome : state.rgOutcomes) {
+        outcome.nSince = state.nAt;
+    }
     Publish(state);
 }
 
