@@ -10,7 +10,7 @@ import homelab
 import networks
 
 PORTS, FIRST, RUNS = 100, 20000, 5
-IGD = f"{homelab.BUILD}/platform/linux/daemons/tavo-igd"
+IGD = f"{homelab.BUILD}/bench/tavo-igd"
 DESCRIPTION = f"-u http://{homelab.GATEWAY}:5000/rootDesc.xml"  # spares upnpc its discovery
 REDIRECTS = "-r " + " ".join(f"{FIRST + i} TCP" for i in range(PORTS))
 AIRPORT_WAIT = 6.0  # six polls, one second apart

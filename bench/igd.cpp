@@ -1,9 +1,11 @@
-// tavo-igd: looks at a router's UPnP table by hand and times what upnpd does.
-// Relies on the same classes as upnpd. Promises: maps and unmaps only what carries our own mark.
+// tavo-igd: times what upnpd does with a router's UPnP table; a tool of the benchmark, not installed.
+// Relies on the same classes as upnpd. Promises: touches only mappings with a mark of its own, never a rule's.
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
+#include <string>
+#include <string_view>
+#include <vector>
 
 #include "daemons/common/Reconcile.h"
 #include "daemons/common/Wanted.h"
@@ -19,23 +21,74 @@ constexpr char kHelp[] =
     "Usage: tavo-igd discover | list | map N | unmap\n"
     "  discover  where the gateway's port-mapping service is, and what the router calls itself\n"
     "  list      the router's table\n"
-    "  map N     make the tool's mappings TCP 20000 and up, N of them (1 to 1000), the only ones with our mark\n"
-    "  unmap     take every mapping with our mark away\n";
+    "  map N     make the tool's mappings TCP 20000 and up, N of them (1 to 1000), the only ones of the tool\n"
+    "  unmap     take the tool's mappings away\n";
+
+constexpr std::string_view kBenchPrefix = "tavobench:";
+constexpr std::string_view kForeignPrefix = "rule's:";
 
 using Clock = std::chrono::steady_clock;
+using tavo::RouterMapping;
+
+// A router as it would look if the benchmark's mappings were the rules': the code under test runs unchanged, and
+// takes the mappings of upnpd itself for another program's.
+class BenchRouter : public tavo::Router {
+public:
+    explicit BenchRouter(tavo::Igd& igd) : mIgd(igd) {}
+    int List(std::vector<RouterMapping>& rgMappings) override { return Shown(mIgd.List(rgMappings), rgMappings); }
+    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                  std::vector<RouterMapping>& rgMappings) override {
+        return Shown(mIgd.ListRange(szProtocol, nFirst, nLast, rgMappings), rgMappings);
+    }
+    int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override {
+        const int nCode = mIgd.Get(szProtocol, nRouterPort, mapping);
+        Show(mapping);
+        return nCode;
+    }
+    int Add(const RouterMapping& mapping) override {
+        RouterMapping sent = mapping;
+        Exchange(sent.szDescription, tavo::kOwnPrefix, kBenchPrefix);
+        return mIgd.Add(sent);
+    }
+    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override {
+        return mIgd.Remove(szProtocol, nRouterPort);
+    }
+
+private:
+    static bool Exchange(std::string& szText, std::string_view szFrom, std::string_view szTo) {
+        const bool blFound = szText.starts_with(szFrom);
+        if (blFound) {
+            szText.replace(0, szFrom.size(), szTo);
+        }
+        return blFound;
+    }
+    static void Show(RouterMapping& mapping) {
+        if (!Exchange(mapping.szDescription, tavo::kOwnPrefix, kForeignPrefix)) {
+            Exchange(mapping.szDescription, kBenchPrefix, tavo::kOwnPrefix);
+        }
+    }
+    static int Shown(int nCode, std::vector<RouterMapping>& rgMappings) {
+        for (RouterMapping& mapping : rgMappings) {
+            Show(mapping);
+        }
+        return nCode;
+    }
+
+    tavo::Igd& mIgd;
+};
 
 void PrintTime(const char* szWhat, Clock::time_point start) {
     std::printf("%s_ms=%.2f\n", szWhat, std::chrono::duration<double, std::milli>(Clock::now() - start).count());
 }
 
 int List(tavo::Igd& igd) {
-    std::vector<tavo::RouterMapping> rgMappings;
+    std::vector<RouterMapping> rgMappings;
     const int nCode = igd.List(rgMappings);
     if (nCode != tavo::kRouterOk) {
         std::fprintf(stderr, "tavo-igd: the router answered %s\n", tavo::CodeText(nCode).c_str());
         return 1;
     }
-    for (const tavo::RouterMapping& mapping : rgMappings) {
+    for (const RouterMapping& mapping : rgMappings) {
         std::printf("%-10s -> %s:%u lease %u '%s'\n", tavo::MappingName(mapping).c_str(), mapping.szClient.c_str(),
                     mapping.nBoxPort, mapping.nLease, mapping.szDescription.c_str());
     }
@@ -43,13 +96,14 @@ int List(tavo::Igd& igd) {
 }
 
 int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
-    std::vector<tavo::RouterMapping> rgWanted;
+    std::vector<RouterMapping> rgWanted;
     for (int i = 0; i < nPorts; ++i) {
         const auto nPort = static_cast<uint16_t>(kFirstPort + i);
         rgWanted.push_back({"TCP", nPort, nPort, "", std::string(tavo::kOwnPrefix) + "igd", 0, true});
     }
     tavo::LeaseHabit habit;
-    const tavo::PassResult result = tavo::Reconcile(igd, rgWanted, szBox, habit, false, [] { return false; });
+    BenchRouter router(igd);
+    const tavo::PassResult result = tavo::Reconcile(router, rgWanted, szBox, habit, false, [] { return false; });
     int nMissing = 0;
     for (const tavo::Outcome& outcome : result.rgOutcomes) {
         if (outcome.verdict.szWord != "1") {
