@@ -207,8 +207,20 @@ class Lab:
                 return ""
         return [int(pid) for pid in os.listdir("/proc") if pid.isdigit() and line(pid) == command]
 
+    def watcher(self, daemon="upnpd"):
+        """The pid of the parent that would start a daemon again; 0: there is none."""
+        try:
+            pid = int(self.read(f"/var/run/{daemon}_watch.lock"))
+            return pid if self.read(f"/proc/{pid}/comm") == "tavowatch\n" else 0
+        except (OSError, ValueError):
+            return 0
+
     def stop_daemon(self, how=signal.SIGTERM, *daemons):
         for daemon in daemons or DAEMONS:
+            watcher = self.watcher(daemon)
+            if watcher and how == signal.SIGKILL:
+                os.kill(watcher, how)
+                wait_for(lambda: not self.watcher(daemon), 5, "nobody starts the daemon again")
             pid = self.daemon_pid(daemon)
             if pid:
                 os.kill(pid, how)

@@ -117,7 +117,8 @@ int TLIBCKill(const char* szName, int nSignal);
 pid_t TLIBCReadPidFile(const char* szPath);
 /* Starts a program without a shell, detached from the caller (own session, no zombie left, no
  * descriptor above standard error), with up to four arguments, ended by the first NULL; returns at
- * once. 0: started; -1: it could not be executed. */
+ * once. One of our own daemons without arguments is started as its unit where systemd runs and has one.
+ * 0: started; -1: it could not be executed, or its unit does not start. */
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4);
 /* Forks; the child keeps the caller's descriptors and handlers. The child: 0; the parent: its pid;
  * negative with errno set: no process could be made. */

@@ -1,4 +1,4 @@
-// Finds, signals and starts processes. Relies on /proc, posix_spawn and closefrom.
+// Finds, signals and starts processes. Relies on /proc, posix_spawn, closefrom, and systemd where it runs.
 // Promises: children get no descriptor above standard error and default signals; TLIBCExec leaves no
 // zombie; zombies do not count as alive.
 #include <dirent.h>
@@ -20,6 +20,7 @@
 #include "core/Border.h"
 #include "core/Descriptor.h"
 #include "core/TextFile.h"
+#include "core/Unit.h"
 #include "tavo/core.h"
 
 extern char** environ;
@@ -176,6 +177,44 @@ int WaitFor(pid_t pid) {
     return WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : kSignalledStatus + WTERMSIG(nStatus);
 }
 
+// Starts a program that belongs to nobody here. 0 or -1.
+int Launch(char* const* rgszArguments) {
+    int rgFdPipe[2];
+    if (pipe2(rgFdPipe, O_CLOEXEC) != 0) {
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    Descriptor fdRead(rgFdPipe[0]);
+    Descriptor fdWrite(rgFdPipe[1]);
+    const pid_t pid = fork();
+    if (pid < 0) {
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    if (pid == 0) {
+        // A child of a child belongs to init, which takes care of its end.
+        setsid();
+        const pid_t pidProgram = fork();
+        if (pidProgram == 0) {
+            BecomeProgram(rgszArguments, rgFdPipe[1]);
+        }
+        if (pidProgram < 0) {
+            ReportAndExit(rgFdPipe[1]);
+        }
+        _exit(0);
+    }
+    fdWrite.Reset();
+    WaitFor(pid);
+    int nErrno = 0;
+    ssize_t nRead = 0;
+    while ((nRead = read(fdRead.Get(), &nErrno, sizeof(nErrno))) < 0 && errno == EINTR) {
+    }
+    // The pipe alone tells: a caller that ignores SIGCHLD gets no exit status.
+    if (nRead != 0) {
+        errno = nErrno;
+        return Fail(TLIBC_ERR_EXEC, __LINE__);
+    }
+    return 0;
+}
+
 class SpawnSetup {
 public:
     SpawnSetup() {
@@ -255,48 +294,21 @@ pid_t TLIBCReadPidFile(const char* szPath) {
 }
 
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4) {
-    if (szPath == nullptr || *szPath == '\0') {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
-    }
-    const char* rgszGiven[] = {szPath, szArg1, szArg2, szArg3, szArg4, nullptr};
-    char* rgszArguments[std::size(rgszGiven)] = {};
-    for (size_t i = 0; i < std::size(rgszGiven) && rgszGiven[i] != nullptr; ++i) {
-        rgszArguments[i] = const_cast<char*>(rgszGiven[i]);
-    }
-    int rgFdPipe[2];
-    if (pipe2(rgFdPipe, O_CLOEXEC) != 0) {
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
-    }
-    Descriptor fdRead(rgFdPipe[0]);
-    Descriptor fdWrite(rgFdPipe[1]);
-    const pid_t pid = fork();
-    if (pid < 0) {
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
-    }
-    if (pid == 0) {
-        // A child of a child belongs to init, which takes care of its end.
-        setsid();
-        const pid_t pidProgram = fork();
-        if (pidProgram == 0) {
-            BecomeProgram(rgszArguments, rgFdPipe[1]);
+    return AtBorder(-1, [&] {
+        if (szPath == nullptr || *szPath == '\0') {
+            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        if (pidProgram < 0) {
-            ReportAndExit(rgFdPipe[1]);
+        // A daemon belongs to the service manager, whoever asks for it.
+        if (const std::optional<bool> blUnit = szArg1 == nullptr ? tavo::StartUnitOf(szPath) : std::nullopt) {
+            return *blUnit ? 0 : Fail(TLIBC_ERR_EXEC, __LINE__);
         }
-        _exit(0);
-    }
-    fdWrite.Reset();
-    WaitFor(pid);
-    int nErrno = 0;
-    ssize_t nRead = 0;
-    while ((nRead = read(fdRead.Get(), &nErrno, sizeof(nErrno))) < 0 && errno == EINTR) {
-    }
-    // The pipe alone tells: a caller that ignores SIGCHLD gets no exit status.
-    if (nRead != 0) {
-        errno = nErrno;
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
-    }
-    return 0;
+        const char* rgszGiven[] = {szPath, szArg1, szArg2, szArg3, szArg4, nullptr};
+        char* rgszArguments[std::size(rgszGiven)] = {};
+        for (size_t i = 0; i < std::size(rgszGiven) && rgszGiven[i] != nullptr; ++i) {
+            rgszArguments[i] = const_cast<char*>(rgszGiven[i]);
+        }
+        return Launch(rgszArguments);
+    });
 }
 
 pid_t TLIBCProcFork() {

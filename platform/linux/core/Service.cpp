@@ -1,10 +1,12 @@
 // System services by the platform's names: through systemd where it runs, else through /etc/init.d.
 // Relies on systemctl or the init script, started without a shell. Promises: names that are no plain
 // service name are refused; every call ends within half a minute.
+#include <algorithm>
 #include <string>
 #include <string_view>
 
 #include "core/Border.h"
+#include "core/Unit.h"
 #include "tavo/core.h"
 
 namespace {
@@ -12,6 +14,11 @@ namespace {
 constexpr char kFile[] = "platform/linux/core/Service.cpp";
 constexpr int kNameSize = 128;
 constexpr char kTimeout[] = "timeout -k 2 28 ";  // for who does not heed the first signal, a second one
+
+constexpr char kSystemd[] = "/run/systemd/system";  // there while systemd is the service manager
+constexpr std::string_view kDaemons = "/usr/tavo/sbin/";
+constexpr const char* kUnitDirs[] = {"/etc/systemd/system/", "/run/systemd/system/", "/usr/local/lib/systemd/system/",
+                                     "/usr/lib/systemd/system/", "/lib/systemd/system/"};
 
 // Where the system's name differs from the platform's.
 struct Alias {
@@ -50,7 +57,7 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
             TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
             return -1;
         }
-        if (TLIBCFileExist("/run/systemd/system") == 1) {
+        if (TLIBCFileExist(kSystemd) == 1) {
             return TLIBCSystem((std::string(kTimeout) + "systemctl " + szSystemdVerb + " " + szSystem +
                                 ".service >/dev/null 2>&1 </dev/null")
                                    .c_str());
@@ -65,6 +72,23 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
 }
 
 }  // namespace
+
+std::optional<bool> tavo::StartUnitOf(std::string_view szProgram) {
+    const bool blOurs = szProgram.starts_with(kDaemons) && IsServiceName(szProgram.substr(kDaemons.size()));
+    if (!blOurs || TLIBCFileExist(kSystemd) != 1) {
+        return std::nullopt;
+    }
+    const std::string szUnit = std::string(szProgram.substr(kDaemons.size())) + ".service";
+    if (std::none_of(std::begin(kUnitDirs), std::end(kUnitDirs),
+                     [&](const char* szDir) { return TLIBCFileExist((szDir + szUnit).c_str()) == 1; })) {
+        return std::nullopt;
+    }
+    // A unit that has crashed too often stays down until somebody asks for it: that is now.
+    const std::string szQuiet = " " + szUnit + " >/dev/null 2>&1 </dev/null";
+    return TLIBCSystem(
+               (std::string(kTimeout) + "sh -c 'systemctl reset-failed" + szQuiet + "; systemctl start" + szQuiet + "'")
+                   .c_str()) == 0;
+}
 
 int TLIBServiceIsRunning(const char* szName) {
     const int nStatus = Control(szName, "is-active", "status");

@@ -4,18 +4,26 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <sys/file.h>
 #include <sys/inotify.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
+#include <cstddef>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <iterator>
+#include <string_view>
 
 #include "core/Descriptor.h"
 #include "core/TextFile.h"
+#include "daemons/common/Instance.h"
 #include "daemons/common/SignalQueue.h"
+#include "daemons/common/Watch.h"
 #include "tavo/core.h"
 
 namespace tavo {
@@ -25,13 +33,17 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 constexpr char kHelp[] =
-    "Usage: %s [--foreground]\n"
+    "Usage: %s [--foreground [--take-over] | --stop | --hand-over]\n"
     "Keeps the %s port mappings of the router in line with /etc/portforward/rule.conf.\n"
+    "Without arguments it goes into the background, where a parent starts it again after a crash.\n"
     "\n"
-    "  --foreground  stay attached to the terminal\n"
+    "  --foreground  stay attached to the terminal, or to the service manager\n"
+    "  --take-over   have one that runs already end and leave its mappings to this one\n"
+    "  --stop        end the one that runs, and take the mappings away\n"
+    "  --hand-over   end the one that runs, and leave the mappings in the router\n"
     "  --help        this text\n"
     "\n"
-    "SIGHUP reads the rules again; SIGTERM takes the mappings away and ends.\n"
+    "SIGHUP reads the rules again; SIGTERM takes the mappings away and ends; SIGUSR1 ends and leaves them.\n"
     "The results stand in %s, the pid in %s.\n"
     "It maps only while %s=\"yes\" stands in /etc/tavoinfo.conf.\n";
 constexpr int kExitUsage = 2;
@@ -40,6 +52,9 @@ constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
 constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
+constexpr auto kEndLimit = std::chrono::seconds(20);   // for another instance: a pass, and the mappings
+constexpr auto kStartLimit = std::chrono::seconds(5);  // of an instance that somebody else starts
+constexpr int kPollMilliseconds = 20;
 
 // Writes our pid where the library looks for it; it deletes the file before it starts a daemon.
 void WritePidFile(const DaemonNames& names) {
@@ -72,6 +87,62 @@ Descriptor Detach() {
         dup2(fdNull.Get(), fd);
     }
     return Descriptor(rgFd[1]);
+}
+
+void Withdraw(Mapper& mapper) {
+    const auto end = Clock::now() + kWithdrawLimit;
+    mapper.Withdraw([end] { return Clock::now() > end; });
+}
+
+// Tells the service manager, where one started us, that the work has begun. Our own children have nothing to tell it.
+void NotifyReady() {
+    const char* szSocket = getenv("NOTIFY_SOCKET");
+    sockaddr_un address = {};
+    if (szSocket != nullptr && std::strlen(szSocket) < sizeof(address.sun_path)) {
+        const Descriptor fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+        address.sun_family = AF_UNIX;
+        const size_t nLength = std::strlen(szSocket);
+        std::memcpy(address.sun_path, szSocket, nLength);
+        address.sun_path[0] = szSocket[0] == '@' ? '\0' : szSocket[0];
+        constexpr std::string_view kReady = "READY=1";
+        sendto(fd.Get(), kReady.data(), kReady.size(), MSG_NOSIGNAL, reinterpret_cast<const sockaddr*>(&address),
+               static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + nLength));
+    }
+    unsetenv("NOTIFY_SOCKET");
+}
+
+bool WaitUntil(std::chrono::seconds limit, const std::function<bool()>& fnTrue) {
+    const auto end = Clock::now() + limit;
+    while (!fnTrue()) {
+        if (Clock::now() > end) {
+            return false;
+        }
+        poll(nullptr, 0, kPollMilliseconds);
+    }
+    return true;
+}
+
+// Ends what runs, the parent that would start it again first of all. True when nothing runs any more.
+bool EndRunning(const DaemonNames& names, int nSignal) {
+    const Instance rgInstances[] = {Instance(Watch::LockFile(names.szName)), Instance(names.szLockFile)};
+    pid_t pidTold = 0;
+    const bool blEnded = WaitUntil(kEndLimit, [&] {
+        for (const Instance& instance : rgInstances) {
+            const pid_t pid = instance.Holder();
+            if (pid > 0 && pid != pidTold) {
+                kill(pid, nSignal);
+                pidTold = pid;
+            }
+            if (pid != 0) {
+                return false;
+            }
+        }
+        return true;
+    });
+    if (!blEnded) {
+        syslog(LOG_ERR, "the %s that runs does not end (lock %s)", names.szName, names.szLockFile);
+    }
+    return blEnded;
 }
 
 class Frame {
@@ -128,8 +199,9 @@ void Frame::RunPass() {
 }
 
 void Frame::Stop() {
-    const auto end = Clock::now() + kWithdrawLimit;
-    mMapper.Withdraw([end] { return Clock::now() > end; });
+    if (!mSignals.IsHandOver()) {
+        Withdraw(mMapper);
+    }
     unlink(mNames.szPidFile);
     RemoveMarker();
 }
@@ -144,6 +216,7 @@ void Frame::Loop() {
         // The marker is made just after the signal or the start that it belongs to, so one that stands
         // here belongs to a request that has been served, though it may have come after the end of it.
         RemoveMarker();
+        WritePidFile(mNames);  // whoever asks for a start deletes it, and makes the marker afterwards
         if (!mSignals.HasRequest()) {
             Wait();
         }
@@ -151,23 +224,69 @@ void Frame::Loop() {
     Stop();
 }
 
-int RunDaemon(Mapper& mapper, bool blForeground) {
+int AnotherRuns(const DaemonNames& names) {
+    syslog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
+    return 1;
+}
+
+int RunInstance(Mapper& mapper, Descriptor& fdReady) {
     const DaemonNames& names = mapper.Names();
-    openlog(names.szName, LOG_PID, LOG_DAEMON);
-    Descriptor fdReady = blForeground ? Descriptor() : Detach();
-    const Descriptor fdLock(open(names.szLockFile, O_RDWR | O_CREAT | O_CLOEXEC, kPrivateMode));
-    if (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
-        syslog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
-        return 1;
+    Instance instance(names.szLockFile);
+    if (!instance.Take()) {
+        return AnotherRuns(names);
     }
     Frame frame(mapper);
     WritePidFile(names);
-    if (fdReady.Get() >= 0 && write(fdReady.Get(), "r", 1) != 1) {
-        syslog(LOG_WARNING, "nobody waited for the start");
-    }
+    const bool blTold = fdReady.Get() < 0 || write(fdReady.Get(), "r", 1) == 1;
+    syslog(LOG_INFO, "%s begins%s", names.szName, blTold ? "" : " anew");
     fdReady.Reset();
+    NotifyReady();
     frame.Loop();
     return 0;
+}
+
+int RunInBackground(Mapper& mapper, char* szTitle) {
+    const DaemonNames& names = mapper.Names();
+    const Instance instance(names.szLockFile);
+    if (instance.Holder() != 0) {
+        return AnotherRuns(names);
+    }
+    // After a crash its parent waits for a moment: what is asked for now need not wait.
+    if (const pid_t pid = Instance(Watch::LockFile(names.szName)).Holder(); pid > 0) {
+        kill(pid, SIGHUP);
+        return WaitUntil(kStartLimit, [&] { return instance.Holder() != 0; }) ? 0 : 1;
+    }
+    Descriptor fdReady = Detach();
+    return Watch(names.szName, szTitle).Run([&] { return RunInstance(mapper, fdReady); });
+}
+
+int StopRunning(Mapper& mapper) {
+    const DaemonNames& names = mapper.Names();
+    Instance instance(names.szLockFile);
+    if (instance.Take()) {  // nobody ran; one that was killed may have left its mappings
+        if (mapper.IsSwitchedOn()) {
+            Withdraw(mapper);
+        }
+        unlink(names.szPidFile);
+        instance.Forget();
+    }
+    return EndRunning(names, SIGTERM) ? 0 : 1;
+}
+
+int RunDaemon(Mapper& mapper, std::string_view szOptions, char* szTitle) {
+    const DaemonNames& names = mapper.Names();
+    openlog(names.szName, LOG_PID, LOG_DAEMON);
+    if (szOptions.empty()) {
+        return RunInBackground(mapper, szTitle);
+    }
+    if (szOptions == "--stop ") {
+        return StopRunning(mapper);
+    }
+    if (szOptions != "--foreground " && !EndRunning(names, SIGUSR1)) {
+        return 1;
+    }
+    Descriptor fdReady;
+    return szOptions == "--hand-over " ? 0 : RunInstance(mapper, fdReady);
 }
 
 void PrintHelp(FILE* pOut, const DaemonNames& names) {
@@ -177,21 +296,22 @@ void PrintHelp(FILE* pOut, const DaemonNames& names) {
 }  // namespace
 
 int DaemonMain(int argc, char** argv, Mapper& mapper) {
-    bool blForeground = false;
+    std::string szOptions;
     for (int i = 1; i < argc; ++i) {
-        const std::string szArgument = argv[i];
-        if (szArgument == "--help") {
-            PrintHelp(stdout, mapper.Names());
-            return 0;
-        }
-        if (szArgument != "--foreground") {
-            std::fprintf(stderr, "%s: unknown argument '%s'\n\n", mapper.Names().szName, argv[i]);
-            PrintHelp(stderr, mapper.Names());
-            return kExitUsage;
-        }
-        blForeground = true;
+        szOptions += std::string(argv[i]) + " ";
     }
-    return RunDaemon(mapper, blForeground);
+    if (szOptions == "--help ") {
+        PrintHelp(stdout, mapper.Names());
+        return 0;
+    }
+    constexpr std::string_view kOptions[] = {"", "--foreground ", "--foreground --take-over ", "--stop ",
+                                             "--hand-over "};
+    if (std::find(std::begin(kOptions), std::end(kOptions), szOptions) == std::end(kOptions)) {
+        std::fprintf(stderr, "%s: unknown arguments '%s'\n\n", mapper.Names().szName, szOptions.c_str());
+        PrintHelp(stderr, mapper.Names());
+        return kExitUsage;
+    }
+    return RunDaemon(mapper, szOptions, argv[0]);
 }
 
 }  // namespace tavo

@@ -1,7 +1,8 @@
 // What every port-mapping daemon does alike: one instance, pid file, signals, the progress marker, the
 // clock of checks and renewals. Relies on signalfd and inotify; the mapping itself is a Mapper's.
 // Promises: the marker goes only after the results of the newest request have been written; a stop
-// takes the mappings away, within a bound.
+// takes the mappings away, within a bound; a hand-over leaves them to the next instance. In the background a
+// parent starts it again after a crash, elsewhere the service manager does.
 #pragma once
 
 #include <functional>
@@ -36,8 +37,8 @@ public:
     virtual bool OnWake() { return false; }
 };
 
-// A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM or
-// SIGINT. Exit status: 0; 1 when another instance runs or nothing could be started; 2 for a wrong argument.
+// A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM, SIGINT or
+// SIGUSR1. Exit status: 0; 1 when another instance runs or nothing could be started; 2 for a wrong argument.
 int DaemonMain(int argc, char** argv, Mapper& mapper);
 
 }  // namespace tavo

@@ -1,5 +1,6 @@
 // The signals of a daemon, taken in when it asks for them. Relies on signalfd.
-// Promises: SIGHUP is a request, SIGTERM and SIGINT are a stop; none is lost; SIGPIPE never comes.
+// Promises: SIGHUP is a request, SIGTERM and SIGINT are a stop, SIGUSR1 is a stop that leaves what was made to
+// whoever comes next; none is lost; SIGPIPE never comes.
 #pragma once
 
 #include <signal.h>
@@ -16,7 +17,7 @@ class SignalQueue {
 public:
     SignalQueue() {
         sigemptyset(&mSignals);
-        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT}) {
+        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT, SIGUSR1}) {
             sigaddset(&mSignals, nSignal);
         }
         sigprocmask(SIG_BLOCK, &mSignals, nullptr);
@@ -33,12 +34,17 @@ public:
                 mBlRequested = true;
             } else {
                 mBlStop = true;
+                mBlHandOver = mBlHandOver || info.ssi_signo == SIGUSR1;
             }
         }
     }
     bool IsStop() {
         Drain();
         return mBlStop;
+    }
+    bool IsHandOver() {
+        Drain();
+        return mBlHandOver;
     }
     bool TakeRequest() {
         Drain();
@@ -54,6 +60,7 @@ private:
     Descriptor mFd;
     bool mBlRequested = false;
     bool mBlStop = false;
+    bool mBlHandOver = false;
 };
 
 }  // namespace tavo

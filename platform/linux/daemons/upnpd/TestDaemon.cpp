@@ -16,14 +16,10 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
-#include <iterator>
-
-extern "C" {  // this header leaves it out
-#include <sys/pidfd.h>
-}
 
 #include "core/TextFile.h"
 #include "daemons/common/Wanted.h"
+#include "daemons/common/Watch.h"
 #include "tavo/core.h"
 #include "tavo/log.h"
 #include "tavo/upnptest.h"
@@ -282,16 +278,12 @@ int TestDaemon::RunTest() {
 
 // Waits for the process that tests, and ends in its place what it could not end.
 int TestDaemon::WatchOver(pid_t pid) {
-    const Descriptor fdEnd(pidfd_open(pid, 0));
-    pollfd rgWaiting[] = {{mSignals.Fd(), POLLIN, 0}, {fdEnd.Get(), POLLIN, 0}};
-    while (fdEnd.Get() >= 0 && rgWaiting[1].revents == 0) {
-        poll(rgWaiting, std::size(rgWaiting), -1);
-        if (IsSignalled() && rgWaiting[1].revents == 0) {
+    const int nStatus = WaitForChild(pid, mSignals, [this, pid] {
+        if (IsSignalled()) {
             kill(pid, SIGTERM);
         }
-    }
-    int nStatus = 0;
-    if (waitpid(pid, &nStatus, 0) == pid && WIFEXITED(nStatus)) {
+    });
+    if (nStatus >= 0 && WIFEXITED(nStatus)) {
         return WEXITSTATUS(nStatus);
     }
     syslog(LOG_ERR, "the test was killed; its mappings are taken away");

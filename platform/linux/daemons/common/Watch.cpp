@@ -1,0 +1,121 @@
+// See Watch.h. Relies on Linux's pidfd. Promises: see Watch.h.
+#include "daemons/common/Watch.h"
+
+#include <poll.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <syslog.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <deque>
+#include <iterator>
+
+extern "C" {  // this header leaves it out
+#include <sys/pidfd.h>
+}
+
+namespace tavo {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// The same bounds stand in the systemd units.
+constexpr auto kPause = std::chrono::seconds(2);
+constexpr auto kCrashWindow = std::chrono::minutes(10);
+constexpr size_t kMostCrashes = 10;
+constexpr char kTitle[] = "tavowatch";
+
+}  // namespace
+
+int WaitForChild(pid_t pid, SignalQueue& signals, const std::function<void()>& fnPassOn) {
+    const Descriptor fdEnd(pidfd_open(pid, 0));
+    pollfd rgWaiting[] = {{signals.Fd(), POLLIN, 0}, {fdEnd.Get(), POLLIN, 0}};
+    while (fdEnd.Get() >= 0 && rgWaiting[1].revents == 0) {
+        poll(rgWaiting, std::size(rgWaiting), -1);
+        if (rgWaiting[0].revents != 0 && rgWaiting[1].revents == 0) {
+            fnPassOn();
+        }
+    }
+    int nStatus = -1;
+    return waitpid(pid, &nStatus, 0) == pid ? nStatus : -1;
+}
+
+Watch::Watch(const char* szName, char* szTitle)
+    : mSzName(szName), mSzTitle(szTitle), mSzOwnTitle(szTitle), mInstance(LockFile(szName)) {}
+
+// Whoever looks for the work by its name must not find the parent: it would count as the work that lives, also
+// between a crash and the new start.
+void Watch::ShowAs(const std::string& szTitle, const char* szName) {
+    std::memset(mSzTitle, 0, mSzOwnTitle.size());
+    std::memcpy(mSzTitle, szTitle.data(), std::min(szTitle.size(), mSzOwnTitle.size()));
+    prctl(PR_SET_NAME, szName);
+}
+
+pid_t Watch::Start(const std::function<int()>& fnWork) {
+    const pid_t pid = fork();
+    if (pid == 0) {
+        ShowAs(mSzOwnTitle, mSzName);
+        mInstance.Forget();
+        _exit(fnWork());
+    }
+    return pid;
+}
+
+void Watch::PassOn(pid_t pid) {
+    if (mSignals.TakeRequest()) {
+        kill(pid, SIGHUP);
+    }
+    if (mSignals.IsHandOver()) {
+        kill(pid, SIGUSR1);
+    } else if (mSignals.IsStop()) {
+        kill(pid, SIGTERM);
+    }
+}
+
+// False: a signal says that it is not to be started again. A request is a reason to start at once.
+bool Watch::Pause() {
+    const auto end = Clock::now() + kPause;
+    while (!mSignals.IsStop() && !mSignals.TakeRequest() && Clock::now() < end) {
+        const auto nLeft = std::chrono::ceil<std::chrono::milliseconds>(end - Clock::now()).count();
+        pollfd waiting = {mSignals.Fd(), POLLIN, 0};
+        poll(&waiting, 1, static_cast<int>(std::max<int64_t>(0, nLeft)));
+    }
+    return !mSignals.IsHandOver();
+}
+
+int Watch::Run(const std::function<int()>& fnWork) {
+    if (!mInstance.Take()) {
+        syslog(LOG_ERR, "another process watches over %s (lock %s)", mSzName, mInstance.LockFile().c_str());
+        return 1;
+    }
+    std::deque<Clock::time_point> crashes;
+    for (;;) {
+        const pid_t pid = Start(fnWork);
+        if (pid < 0) {
+            return 1;
+        }
+        ShowAs(kTitle, kTitle);
+        PassOn(pid);  // a stop that came in the pause: what the crash left in the router is taken away
+        const int nStatus = WaitForChild(pid, mSignals, [this, pid] { PassOn(pid); });
+        if (nStatus < 0 || WIFEXITED(nStatus)) {
+            return nStatus < 0 ? 1 : WEXITSTATUS(nStatus);
+        }
+        crashes.push_back(Clock::now());
+        while (crashes.front() < Clock::now() - kCrashWindow) {
+            crashes.pop_front();
+        }
+        syslog(LOG_ERR, "%s was ended by signal %d", mSzName, WTERMSIG(nStatus));
+        if (mSignals.IsStop() || crashes.size() >= kMostCrashes) {
+            syslog(LOG_ERR, "%s is not started again", mSzName);
+            return 1;
+        }
+        if (!Pause()) {
+            return 0;
+        }
+    }
+}
+
+}  // namespace tavo

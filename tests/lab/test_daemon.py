@@ -1,0 +1,88 @@
+"""A daemon outside any service manager: started again after a crash, handed over, stopped whatever state it is in."""
+import os
+import signal
+import subprocess
+import unittest
+
+import homelab
+from homelab import BOX, wait_for
+
+LAB = None
+DAEMON = "/usr/tavo/sbin/upnpd"
+MAPPED = {("tcp", 5001): (BOX, 5001)}
+
+
+def option(*options):
+    return LAB.run("box", " ".join((DAEMON, *options)), check=False).returncode
+
+
+class Daemon(unittest.TestCase):
+    def setUp(self):
+        LAB.install()
+        LAB.start_router()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+        self.assertEqual(LAB.mappings(), MAPPED)
+
+    def tearDown(self):
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.stop_router()
+        LAB.clear_state()
+
+    def crash(self):
+        pid = LAB.daemon_pid()
+        os.kill(pid, signal.SIGKILL)
+        wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 5, "it has crashed")
+        return pid
+
+    def only_daemon(self):
+        """The one process that goes by the daemon's name, which is the one that the pid file names."""
+        pids = LAB.processes_of(DAEMON)
+        return pids == [LAB.daemon_pid()] and pids[0]
+
+    def test_a_crash_is_followed_by_a_new_start_but_not_without_end(self):
+        old = self.crash()
+        self.assertEqual(LAB.processes_of(DAEMON), [])  # the parent that waits is not taken for the daemon
+        new = wait_for(self.only_daemon, 10, "it runs again")
+        self.assertNotEqual(new, old)
+        LAB.reboot_router()
+        os.kill(new, signal.SIGHUP)
+        wait_for(lambda: LAB.mappings() == MAPPED, 20, "it works as before")
+        self.crash()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)  # a request does not wait for the pause
+        self.assertTrue(self.only_daemon())
+        for _ in range(8):
+            self.crash()
+            wait_for(lambda: self.only_daemon() or not LAB.watcher(), 10, "it runs again, or has been given up")
+        self.assertEqual((LAB.processes_of(DAEMON), LAB.watcher()), ([], 0))
+
+    def test_a_hand_over_leaves_the_mappings_and_a_second_start_nothing_at_all(self):
+        self.assertEqual(option(), 1)
+        self.assertEqual(option("--foreground"), 1)
+        old = self.only_daemon()
+        changes = LAB.start("router", "nft", "monitor", stdout=subprocess.PIPE, text=True)
+        new = LAB.start("box", DAEMON, "--foreground", "--take-over")
+        wait_for(lambda: LAB.daemon_pid() == new.pid, 10, "the new one has taken over")
+        self.assertFalse(os.path.exists(f"/proc/{old}") or LAB.watcher())
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+        self.assertEqual(LAB.daemon_pid(), new.pid)
+        self.assertEqual(option("--hand-over"), 0)
+        self.assertEqual(new.wait(), 0)
+        LAB.end(changes)
+        self.assertNotIn("delete rule", changes.stdout.read())
+        self.assertEqual(LAB.mappings(), MAPPED)
+        self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
+
+    def test_a_stop_takes_the_mappings_away_whatever_is_left_to_stop(self):
+        for before in (lambda: None, self.crash, lambda: os.kill(LAB.watcher(), signal.SIGKILL),
+                       lambda: LAB.stop_daemon(signal.SIGKILL)):
+            with self.subTest(before=before):
+                self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+                before()
+                self.assertEqual(LAB.mappings(), MAPPED)
+                self.assertEqual(option("--stop"), 0)
+                self.assertEqual((LAB.mappings(), LAB.processes_of(DAEMON), LAB.watcher()), ({}, [], 0))
+                self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
+
+
+if __name__ == "__main__":
+    homelab.run_tests(lambda _: None)
