@@ -84,7 +84,9 @@ std::string FullName(const CLI::App& app) {
 std::vector<std::string> CommandNames(const CLI::App& app) {
     std::vector<std::string> rgszNames;
     for (const CLI::App* pCommand : CommandsOf(app)) {
-        rgszNames.push_back(pCommand->get_name());
+        if (!pCommand->get_group().empty()) {  // the others are for packaging
+            rgszNames.push_back(pCommand->get_name());
+        }
     }
     return rgszNames;
 }

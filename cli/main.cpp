@@ -5,6 +5,7 @@
 #include <string_view>
 
 #include "Commands.h"
+#include "Completions.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -59,6 +60,7 @@ Reply Answer(int argc, char** argv, Request& request) {
     OfferReport(app, request);
     OfferService(app, request);
     OfferDiag(app, request);
+    OfferCompletions(app, request);
     try {
         app.parse(argc, argv);
     } catch (const CLI::CallForHelp&) {

@@ -1,43 +1,85 @@
 #!/bin/bash
-# Makes the Debian package and takes it through its life: installed, used, installed again over a running
-# daemon, removed, purged. Runs inside tests/sandbox. Usage: package.sh BUILD_DIR
+# Makes the Debian packages and takes them through their life without systemd: installed, used, built against,
+# installed again over a running daemon, removed, purged; and installs from the build as it is. What systemd does
+# with them is scripts/booted's. Runs inside tests/sandbox. Usage: package.sh BUILD_DIR
 set -eu
 cd "$(mktemp -d)"
 export SYSTEMD_OFFLINE=1
+rm -f /usr/sbin/policy-rc.d # which may forbid to start anything
 fail() { echo "FAILED: $1" && exit 1; }
-absent() { [ ! -e "$1" ] || fail "$1 is still there"; }
-cpack -G DEB --config "$1/CPackConfig.cmake" -B "$PWD" >cpack.log || { cat cpack.log && exit 1; }
-readonly szPackage=$(echo "$PWD"/*.deb)
+absent() { for szPath in "$@"; do [ ! -e "$szPath" ] || fail "$szPath is still there"; done; }
+install() { dpkg --force-depends -i $(printf '%s_*.deb ' "$@") >dpkg.log 2>&1 || { cat dpkg.log && fail "$* cannot be installed"; }; }
+pid() { cat "/run/$1.pid" 2>/dev/null; }
+alive() { [ -n "$(pid "$1")" ] && kill -0 "$(pid "$1")"; }
+(umask 022 && cpack -G DEB --config "$1/CPackConfig.cmake" -B "$PWD" >cpack.log) || { cat cpack.log && exit 1; }
+for szDeb in *.deb; do
+    dpkg-deb -c "$szDeb" | grep '/changelog.gz$' >/dev/null || fail "$szDeb has no changelog"
+done
 
-dpkg --force-depends -i "$szPackage" >/dev/null
-for szUnit in $(dpkg -L libtavoportmap | sed -n 's|^/usr/lib/systemd/system/||p'); do
-    blEnabled=$([ -L "/etc/systemd/system/multi-user.target.wants/$szUnit" ] && echo yes || echo no)
-    [ "$blEnabled" = "$([ "$szUnit" = tavoportcheckd.service ] && echo no || echo yes)" ] ||
-        fail "$szUnit enabled: $blEnabled"
+# The port checker alone brings nothing else, and does not start by itself.
+install ./libtavoportmap0 ./tavoportcheckd
+[ "$(ls /usr/tavo/sbin /usr/tavo/bin 2>/dev/null | grep -c .)" -le 2 ] || fail "the port checker brings more than itself"
+[ ! -L /etc/systemd/system/multi-user.target.wants/tavoportcheckd.service ] || fail "the port checker is enabled"
+[ "$(stat -c %a /etc/tavo/portcheck.conf)" = 600 ] || fail "others can read the port checker's token"
+dpkg -P tavoportcheckd >/dev/null
+absent /etc/tavo
+
+install ./tavoportmap
+for szUnit in $(dpkg -L tavoportmap | sed -n 's|^/usr/lib/systemd/system/||p'); do
+    [ -L "/etc/systemd/system/multi-user.target.wants/$szUnit" ] || fail "$szUnit is not enabled"
     szProgram=$(sed -n 's/^ExecStart=\([^ ]*\).*/\1/p' "/usr/lib/systemd/system/$szUnit")
     [ -x "$szProgram" ] || fail "$szUnit starts $szProgram, which is not there"
-    ldd "$szProgram" | grep -q 'not found' && fail "$szProgram lacks a library"
+done
+for szProgram in /usr/tavo/sbin/* /usr/tavo/bin/tavo* $(dpkg -L tavoportmap | grep ^/usr/bin/.); do
+    ! ldd "$szProgram" | grep -q 'not found' || fail "$szProgram lacks a library"
+    dpkg -L tavoportmap | grep -q "/man[18]/${szProgram##*/}\.[18]\.gz$" || fail "$szProgram has no manual page"
 done
 for szTool in curl wget; do
     "/usr/tavo/bin/$szTool" --version >/dev/null || fail "the library's $szTool does not run"
 done
-for szConf in platform.conf portcheck.conf; do
-    dpkg-query -W -f '${Conffiles}' libtavoportmap | grep -q "^ */etc/tavo/$szConf " || fail "$szConf is no conffile"
-done
-[ "$(stat -c %a /etc/tavo/portcheck.conf)" = 600 ] || fail "others can read the port checker's token"
+[ -z "$(dpkg -L tavoportmap | grep ^/etc/ | while read -r szFile; do
+    [ -d "$szFile" ] || dpkg-query -W -f '${Conffiles}' tavoportmap | grep -q " $szFile " || echo "$szFile"
+done)" ] || fail "a file in /etc is no conffile"
 [ "$(stat -c %a /tmp/upnp_test.lock)" = 600 ] || fail "the lock files are not there"
 tavoportmap status | grep -q '^gateway' || fail "the installed tool does not run"
 tavoportmap rules add web --router-port 443 >/dev/null
+completed() { # WORDS... : what bash offers for the last one
+    COMP_WORDS=(tavoportmap "$@") COMP_CWORD=$# && _tavoportmap && echo "${COMPREPLY[*]}"
+}
+source /usr/share/bash-completion/completions/tavoportmap
+[ "$(completed rules --json a)" = add ] && [ -z "$(completed rules add --router-port 4)" ] &&
+    [ "$(completed rules add --router)" = --router-port ] || fail "the completions do not know the commands"
 
+# Programs are built against what is installed, by pkg-config and by CMake.
+install ./libtavoportmap-dev
+cp -r /usr/share/doc/libtavoportmap-dev/examples .
+readonly szFlags=$(pkg-config --cflags --libs libtavoportmap)
+cc -std=c11 -Wall -Werror examples/ports.c $szFlags -o ports && ./ports | grep -q '80-82, 443$' || fail "the C example"
+c++ -std=c++20 -Wall -Werror examples/router.cpp $szFlags -o router && ./router | grep -q '^13 ports$' || fail "the C++ example"
+cmake -S examples -B examples/b >cmake.log && cmake --build examples/b >>cmake.log || { cat cmake.log && fail "CMake"; }
+examples/b/router >/dev/null || fail "what CMake builds does not run"
+
+# A daemon that runs without systemd is replaced, with its parent, and ends before its program goes.
+echo 'runupnpportmapping="yes"' >>/etc/tavoinfo.conf
 /usr/tavo/sbin/upnpd
-readonly nOld=$(cat /run/upnpd.pid)
-dpkg --force-depends -i "$szPackage" >/dev/null
-[ "$(cat /run/upnpd.pid)" != "$nOld" ] || fail "the old daemon was left running"
-
-dpkg -r libtavoportmap >/dev/null
-absent /run/upnpd.pid
-absent /usr/bin/tavoportmap
+readonly nOld=$(pid upnpd)
+install ./tavoportmap
+alive upnpd && [ "$(pid upnpd)" != "$nOld" ] || fail "the old daemon was left running"
+dpkg -r libtavoportmap-dev tavoportmap >/dev/null
+absent /run/upnpd.pid /usr/bin/tavoportmap
+! pgrep -x 'upnpd|tavowatch' >/dev/null || fail "a process was left running"
 [ -e /etc/portforward/rule.conf ] || fail "removing took the rules away"
-dpkg -P libtavoportmap >/dev/null
-absent /etc/portforward
-absent /etc/tavo
+install ./tavoportmap
+alive upnpd || fail "what was switched on does not run again"
+kill -9 "$(pid upnpd)" # its parent is about to start it again
+dpkg -P tavoportmap >/dev/null
+! pgrep -x 'upnpd|tavowatch' >/dev/null || fail "a process was left running"
+absent /etc/portforward /etc/tavo /etc/tavoinfo.conf /etc/logrotate.d/tavoportmap /var/lib/tavo /etc.defaults /run/upnpd*.lock /tmp/*.lock
+
+# An installation from the build keeps what a user has changed.
+cmake --install "$1" >install.log
+grep -q 'systemctl enable --now' install.log || fail "nothing is said about what is to be enabled"
+echo '# mine' >>/etc/tavo/platform.conf
+cmake --install "$1" >install.log
+tail -n 1 /etc/tavo/platform.conf | grep -q mine && grep -q 'Kept: /etc/tavo/platform.conf' install.log &&
+    [ -s /etc/tavo/platform.conf.new ] || fail "a changed setting was overwritten"
