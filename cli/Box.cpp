@@ -19,12 +19,15 @@ Reply NoGateway() {
                 "routes"};
 }
 
+std::optional<Reply> NeedsRoot() {
+    return geteuid() == 0
+               ? std::nullopt
+               : std::optional(Reply{.enExit = kFailed, .szMessage = "this command needs root: run it with sudo"});
+}
+
 Reply Busy() {
-    std::string szMessage = "another port-forwarding operation is running; try again when it has ended";
-    if (geteuid() != 0) {
-        szMessage += "\n(or this user may not take the lock /tmp/routerconf.lock: try it with sudo)";
-    }
-    return {.enExit = kBusy, .szMessage = szMessage};
+    return NeedsRoot().value_or(Reply{
+        .enExit = kBusy, .szMessage = "another port-forwarding operation is running; try again when it has ended"});
 }
 
 Reply Failure(const std::string& szMessage) {

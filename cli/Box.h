@@ -14,6 +14,9 @@ namespace tavo::cli {
 std::optional<std::string> Gateway();
 Reply NoGateway();
 
+// What to tell a user who is not root; nothing when he is.
+std::optional<Reply> NeedsRoot();
+
 // Another operation holds the router lock.
 Reply Busy();
 // szMessage, and that root may be missing where it is.

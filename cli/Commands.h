@@ -14,6 +14,8 @@ struct Request {
     std::function<Reply()> fnCommand;  // what the arguments ask for
 };
 
+void OfferOpen(CLI::App& app, Request& request);
+void OfferClose(CLI::App& app, Request& request);
 void OfferRules(CLI::App& app, Request& request);
 void OfferSave(CLI::App& app, Request& request);
 void OfferStatus(CLI::App& app, Request& request);

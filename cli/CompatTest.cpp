@@ -1,13 +1,10 @@
-// Ends compatibility tests. Relies on TLibStopTestUpnpCompatibility, and on a thread that waits for what a
-// signal handler may only note. Promises: see CompatTest.h.
+// Ends compatibility tests. Relies on TLibStopTestUpnpCompatibility. Promises: see CompatTest.h.
 #include "CompatTest.h"
 
-#include <fcntl.h>
 #include <poll.h>
-#include <unistd.h>
 
 #include <chrono>
-#include <csignal>
+#include <utility>
 
 #include "Box.h"
 
@@ -17,26 +14,6 @@ namespace {
 
 constexpr int kPollMilliseconds = 200;
 constexpr auto kStopLimit = std::chrono::seconds(10);
-constexpr int kSignals[] = {SIGINT, SIGTERM, SIGHUP};
-constexpr char kLeave = 'l';
-constexpr char kDone = 'd';
-
-// The one end that the handler may write to.
-int gFdNote = -1;
-
-void NoteSignal(int /*nSignal*/) {
-    const ssize_t nWritten = write(gFdNote, &kLeave, 1);
-    static_cast<void>(nWritten);  // a full pipe holds the same note
-}
-
-void Handle(void (*pfnHandler)(int)) {
-    struct sigaction action = {};
-    action.sa_handler = pfnHandler;
-    action.sa_flags = static_cast<int>(SA_RESETHAND);
-    for (const int nSignal : kSignals) {
-        sigaction(nSignal, &action, nullptr);
-    }
-}
 
 }  // namespace
 
@@ -70,37 +47,13 @@ Reply AlreadyTesting() {
             .szMessage = "a compatibility test is running already; 'tavoportmap compat --stop' would end it"};
 }
 
-StopOnSignal::StopOnSignal(bool blJson, std::function<void()> fnPark) : mBlJson(blJson), mFnPark(std::move(fnPark)) {
-    int rgFds[2] = {-1, -1};
-    if (pipe2(rgFds, O_CLOEXEC) != 0) {
-        return;  // without it a signal ends the program; the test then ends by itself, a little later
-    }
-    gFdNote = rgFds[1];
-    mThread = std::thread([this, fd = rgFds[0]] { Watch(fd); });
-    Handle(&NoteSignal);
-}
-
-StopOnSignal::~StopOnSignal() {
-    Handle(SIG_DFL);
-    if (mThread.joinable()) {
-        const ssize_t nWritten = write(gFdNote, &kDone, 1);
-        static_cast<void>(nWritten);
-        mThread.join();
-        close(gFdNote);
-    }
-}
-
-void StopOnSignal::Watch(int fd) const {
-    char cNote = kDone;
-    const ssize_t nRead = TEMP_FAILURE_RETRY(read(fd, &cNote, 1));
-    if (nRead == 1 && cNote == kLeave) {
-        mFnPark();
-        Reply reply = Stopped(StopTest());
-        reply.enExit = kFailed;
-        Print(reply, mBlJson);
-        _exit(reply.enExit);
-    }
-    close(fd);
-}
+StopOnSignal::StopOnSignal(bool blJson, std::function<void()> fnPark)
+    : OnSignal([blJson, fnPark = std::move(fnPark)] {
+          fnPark();
+          Reply reply = Stopped(StopTest());
+          reply.enExit = kFailed;
+          Print(reply, blJson);
+          return static_cast<int>(reply.enExit);
+      }) {}
 
 }  // namespace tavo::cli

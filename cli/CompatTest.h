@@ -3,9 +3,9 @@
 #pragma once
 
 #include <functional>
-#include <thread>
 
 #include "Answer.h"
+#include "OnSignal.h"
 
 namespace tavo::cli {
 
@@ -18,22 +18,11 @@ bool StopTest();
 // What became of a stopped test.
 Reply Stopped(bool blEnded);
 
-// While it lives, SIGINT, SIGTERM and SIGHUP stop the test, show what became of it and end the program; a
-// second SIGINT ends the program at once.
-class StopOnSignal {
+// While it lives, a signal that asks this program to end stops the test, shows what became of it and ends the program.
+class StopOnSignal : private OnSignal {
 public:
     // fnPark is called before the test is stopped; what it locks keeps the program from going on.
     StopOnSignal(bool blJson, std::function<void()> fnPark);
-    ~StopOnSignal();
-    StopOnSignal(const StopOnSignal&) = delete;
-    StopOnSignal& operator=(const StopOnSignal&) = delete;
-
-private:
-    void Watch(int fd) const;
-
-    bool mBlJson;
-    std::function<void()> mFnPark;
-    std::thread mThread;
 };
 
 }  // namespace tavo::cli

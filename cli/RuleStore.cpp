@@ -18,6 +18,7 @@ namespace tavo::cli {
 namespace {
 
 constexpr int kPorts = 65536;
+constexpr int kMaxNumber = 1'000'000'000;  // ids beyond it are not ours, and need no successor
 
 bool ReadRule(RouterRuleConfReader& reader, Rule& rule) {
     reader.GetRuleServiceName(rule.szName);
@@ -25,7 +26,8 @@ bool ReadRule(RouterRuleConfReader& reader, Rule& rule) {
                                                                   rule.szProtocol, rule.szServiceId) != 0;
 }
 
-std::optional<int> ParsePort(const std::string& szText) {
+std::optional<int> ParsePort(const std::string& szPadded) {
+    const std::string szText = CLI::detail::trim_copy(szPadded);  // the library writes lists as "80, 443"
     int nPort = 0;
     const char* pEnd = szText.data() + szText.size();
     const auto [pRead, error] = std::from_chars(szText.data(), pEnd, nPort);
@@ -85,16 +87,6 @@ std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords() {
     return rgRecords;
 }
 
-bool StoreRules(const Rules& rules) {
-    RouterRuleConfWriter writer;
-    return std::all_of(rules.begin(), rules.end(),
-                       [&](const Rule& rule) {
-                           return writer.AddRule(rule.szId, rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts,
-                                                 rule.szProtocol, rule.szServiceId, rule.szName) != 0;
-                       }) &&
-           writer.Sync() != 0;
-}
-
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules) {
     std::vector<__tag_TAVO_ROUTER_RULE> rgRecords(rules.size());
     for (size_t i = 0; i < rules.size(); ++i) {
@@ -142,6 +134,16 @@ std::vector<Overlap> OverlapsOf(const Rules& rules) {
         }
     }
     return rgFound;
+}
+
+std::string NextId(const Rules& rules) {
+    int nLast = 0;
+    for (const Rule& rule : rules) {
+        int nId = 0;
+        std::from_chars(rule.szId.data(), rule.szId.data() + rule.szId.size(), nId);
+        nLast = nId < kMaxNumber ? std::max(nLast, nId) : nLast;
+    }
+    return std::to_string(nLast + 1);
 }
 
 Json::Value ToJson(const Rule& rule) {

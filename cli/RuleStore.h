@@ -1,5 +1,7 @@
-// The stored rules. Relies on the library's readers and writer of rule.conf. Promises: rules that could
-// not be read whole are never written back; a value is never cut, and a rule without a name stays so.
+// The stored rules: those in force (rule.conf), those edited and not saved yet (the draft beside it), and those that
+// 'off' switched off. Relies on the library's readers and writer of rule.conf. Promises: rules that could not be read
+// whole are never written back; a value is never cut, and a rule without a name stays so; an edit is not lost when
+// somebody else changes rule.conf meanwhile, nor is what they changed.
 #pragma once
 
 #include <memory>
@@ -24,18 +26,45 @@ struct Rule {
 
 using Rules = std::vector<Rule>;
 
-// Nothing when rule.conf cannot be read.
+// The rules in force. Nothing when rule.conf cannot be read.
 std::optional<Rules> LoadRules();
 // The same as the library's own array, with its cuts and lent names.
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords();
-// False when they could not be written; the old ones are still there then.
-bool StoreRules(const Rules& rules);
+
+// The rules as the next save would have them: those in force with the edits since. Nothing when either cannot be read.
+std::optional<Rules> LoadDraft();
+bool HasDraft();
+// False when it could not be written; the old edits are still there then. Rules like those in force end the draft.
+bool StoreDraft(const Rules& rules);
+// True when no edit is left.
+bool DropDraft();
+// Which of the two files cannot be read, and what to do.
+Reply Unreadable();
+
+// The edits that lead from base to edited, made once more on current, which somebody else has changed since.
+Rules Rebase(const Rules& base, const Rules& edited, const Rules& current);
+// Whether they ask for the same, whatever their ids and the way that their ports are written.
+bool IsSameContent(const Rule& one, const Rule& other);
+// For each rule of one its fellow in other by id, and by content where an id stands twice; npos where there is none.
+std::vector<size_t> Fellows(const Rules& one, const Rules& other);
+
+// The rules that 'off' switched off; nothing when it did not, or when somebody has opened ports since.
+std::optional<Rules> LoadOff();
+inline bool IsOff() {
+    return LoadOff().has_value();
+}
+bool StoreOff(const Rules& rules);
+bool DropOff();
+
 // As the library takes them; nothing when a value is too long for its record.
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules);
 
 extern const char kUnreadable[];
 
 Json::Value ToJson(const Rule& rule);
+
+// The id after the highest number.
+std::string NextId(const Rules& rules);
 
 // Says which rules there are.
 Reply NoSuchRule(const Rules& rules, const std::string& szId);

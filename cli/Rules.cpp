@@ -1,14 +1,18 @@
-// "rules": list, add, remove, enable, disable. Relies on the rule store and the router lock. Promises: the
-// file is read, changed and written under the lock; a change that would take another rule's port is
-// refused unless --force says otherwise, and overlaps that are there are pointed out.
+// "rules": list, add, remove, enable, disable, edit, discard, import, export. Relies on the rule store and the router
+// lock. Promises: an edit changes the draft, under the lock, and nothing that is in force; one that would take
+// another rule's port is refused unless --force says otherwise, and overlaps that are there are pointed out.
 #include <fmt/format.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <charconv>
+#include <fstream>
+#include <iostream>
+#include <iterator>
 
 #include "Box.h"
 #include "Commands.h"
+#include "PortPairs.h"
+#include "RuleImport.h"
 #include "RuleStore.h"
 #include "Usage.h"
 
@@ -16,9 +20,8 @@ namespace tavo::cli {
 
 namespace {
 
-constexpr char kNotWritten[] = "the rules could not be written; the old ones are still there";
 constexpr char kDirectory[] = "/etc/portforward";
-constexpr int kMaxNumber = 1'000'000'000;  // ids beyond it are not ours, and need no successor
+constexpr char kNext[] = "not in force yet: 'tavoportmap save' writes it to the router";
 
 struct NewRule {
     Rule rule;
@@ -43,25 +46,6 @@ void WarnOfOverlaps(const Rules& rules, Reply& reply) {
     }
 }
 
-std::string FaultOfPorts(const Rule& rule) {
-    for (const std::string& szPorts : {rule.szRouterPorts, rule.szBoxPorts}) {
-        if (!ParsePorts(szPorts)) {
-            return fmt::format("'{}' is no port list: write ports from 1 to 65535, such as 443, 80,443 or 5000-5010",
-                               Clean(szPorts));
-        }
-    }
-    const size_t nRouter = ParsePorts(rule.szRouterPorts)->size();
-    const size_t nBox = ParsePorts(rule.szBoxPorts)->size();
-    if (nRouter != nBox) {
-        return fmt::format("{} router ports but {} box ports: each router port needs one box port", nRouter, nBox);
-    }
-    const size_t nLongest = std::max({rule.szRouterPorts.size(), rule.szBoxPorts.size(), rule.szName.size()});
-    return nLongest < TAVO_TEXT_SIZE
-               ? ""
-               : fmt::format("a name or port list is {} bytes long; {} is the most that a rule can hold", nLongest,
-                             TAVO_TEXT_SIZE - 1);
-}
-
 // The enabled rule that already wants one of the ports of the rule szId.
 std::string FaultOfOverlap(const Rules& rules, const std::string& szId) {
     for (const Overlap& overlap : OverlapsOf(rules)) {
@@ -75,38 +59,32 @@ std::string FaultOfOverlap(const Rules& rules, const std::string& szId) {
     return "";
 }
 
-std::string NextId(const Rules& rules) {
-    int nLast = 0;
-    for (const Rule& rule : rules) {
-        int nId = 0;
-        std::from_chars(rule.szId.data(), rule.szId.data() + rule.szId.size(), nId);
-        nLast = nId < kMaxNumber ? std::max(nLast, nId) : nLast;
-    }
-    return std::to_string(nLast + 1);
-}
-
-// Reads the rules, has fnChange change them and writes them, all of it under the lock. fnChange answers
-// what the user is told; the rules are written only when that is no complaint.
+// Reads the rules with their edits, has fnChange change them and keeps them as the draft, all of it under the lock.
+// fnChange answers what the user is told; nothing is kept when that is a complaint.
 Reply ChangeRules(const std::function<Reply(Rules&)>& fnChange) {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     const Lock lock;
     if (!lock.IsHeld()) {
         return Busy();
     }
-    auto rules = LoadRules();
+    auto rules = LoadDraft();
     if (!rules) {
-        return Failure(kUnreadable);
+        return Unreadable();
     }
     Reply reply = fnChange(*rules);
-    if (reply.enExit == kOk && !StoreRules(*rules)) {
-        return Failure(std::string(kNotWritten) +
-                       (access(kDirectory, W_OK) == 0 ? "" : fmt::format("; {} is missing or read-only", kDirectory)));
+    if (reply.enExit == kOk && !StoreDraft(*rules)) {
+        return Failure(
+            fmt::format("the edit could not be written to {}; nothing was changed{}", kDirectory,
+                        access(kDirectory, W_OK) == 0 ? " (is the disk full?)" : ", which is missing or read-only"));
     }
     WarnOfOverlaps(*rules, reply);
     return reply;
 }
 
 Reply AddRule(Rule rule, bool blForce) {
-    if (const std::string szFault = FaultOfPorts(rule); !szFault.empty()) {
+    if (const std::string szFault = FaultOf(rule); !szFault.empty()) {
         return {.enExit = kUsage, .szMessage = szFault};
     }
     return ChangeRules([&](Rules& rules) -> Reply {
@@ -117,60 +95,165 @@ Reply AddRule(Rule rule, bool blForce) {
             return {.enExit = kUsage, .szMessage = szFault};
         }
         rules = rulesNew;
-        Reply reply{.szMessage = fmt::format("rule {} stored; 'tavoportmap save' writes it to the router", rule.szId)};
+        Reply reply{.szMessage = fmt::format("rule {} noted, {}", rule.szId, kNext)};
         reply.jsAnswer["id"] = rule.szId;
         return reply;
     });
 }
 
-enum class Change { kRemove, kEnable, kDisable };
-
-Reply ChangeRule(const std::string& szId, Change enChange, bool blForce) {
+// Removes the rule that szWhich names, or has fnEdit change it, whose complaint keeps it as it was.
+Reply ChangeRule(const std::string& szWhich, bool blForce, const std::function<std::string(Rule&)>& fnEdit,
+                 bool blRemove) {
     return ChangeRules([&](Rules& rules) -> Reply {
-        const auto pRule =
-            std::find_if(rules.begin(), rules.end(), [&](const Rule& rule) { return rule.szId == szId; });
-        if (pRule == rules.end()) {
-            return NoSuchRule(rules, szId);
+        const Choice choice = Choose(rules, szWhich);
+        if (choice.nRule == std::string::npos) {
+            return {.enExit = kUsage, .szMessage = choice.szFault};
         }
-        if (enChange == Change::kRemove) {
-            rules.erase(pRule);
-        } else {
-            pRule->blEnabled = enChange == Change::kEnable;
-        }
-        const std::string szFault = enChange == Change::kEnable && !blForce ? FaultOfOverlap(rules, szId) : "";
-        if (!szFault.empty()) {
+        Rules rulesNew = rules;
+        Rule& rule = rulesNew[choice.nRule];
+        const std::string szId = rule.szId;
+        if (blRemove) {
+            rulesNew.erase(rulesNew.begin() + static_cast<std::ptrdiff_t>(choice.nRule));
+        } else if (const std::string szFault = fnEdit(rule); !szFault.empty()) {
             return {.enExit = kUsage, .szMessage = szFault};
+        } else if (const std::string szOverlap = FaultOfOverlap(rulesNew, szId);
+                   rule.blEnabled && !blForce && !szOverlap.empty()) {
+            return {.enExit = kUsage, .szMessage = szOverlap};
         }
-        Reply reply{.szMessage = "stored; 'tavoportmap save' writes the rules to the router"};
+        rules = rulesNew;
+        Reply reply{.szMessage = fmt::format("noted, {}", kNext)};
         reply.jsAnswer["id"] = szId;
         return reply;
     });
 }
 
-std::string TableRow(const std::string& szId, const std::string& szState, const Rule& rule) {
-    return fmt::format("{:<4} {:<8} {:<6} {:<20} {:<20} {}\n", Clean(szId), szState, Clean(rule.szProtocol),
-                       Clean(rule.szRouterPorts), Clean(rule.szBoxPorts), Clean(rule.szName));
+// ---- list --------------------------------------------------------------------------------------------------
+
+std::string TableRow(const std::string& szId, const std::string& szState, const Rule& rule, const std::string& szNote) {
+    std::string szRow =
+        fmt::format("{:<4} {:<8} {:<6} {:<20} {:<20} {:<16} {}", Clean(szId), szState, Clean(rule.szProtocol),
+                    Clean(rule.szRouterPorts), Clean(rule.szBoxPorts), Clean(rule.szName), szNote);
+    szRow.erase(szRow.find_last_not_of(' ') + 1);
+    return szRow + "\n";
+}
+
+// Adds what the draft changes; whether it changes anything.
+bool ListEdited(const Rules& inForce, const Rules& rules, Reply& reply) {
+    const std::vector<size_t> rgBefore = Fellows(rules, inForce);
+    const std::vector<size_t> rgAfter = Fellows(inForce, rules);
+    bool blEdited = false;
+    reply.jsAnswer["rules"] = Json::arrayValue;
+    reply.jsAnswer["removed"] = Json::arrayValue;
+    for (size_t i = 0; i < rules.size(); ++i) {
+        const bool blNew = rgBefore[i] == std::string::npos;
+        const std::string szChange = blNew ? "new" : IsSameContent(rules[i], inForce[rgBefore[i]]) ? "" : "changed";
+        blEdited = blEdited || !szChange.empty();
+        reply.szBody += TableRow(rules[i].szId, rules[i].blEnabled ? "enabled" : "disabled", rules[i],
+                                 szChange.empty() ? "" : szChange + ", not saved");
+        Json::Value js = ToJson(rules[i]);
+        js["change"] = szChange.empty() ? Json::Value() : Json::Value(szChange);
+        reply.jsAnswer["rules"].append(js);
+    }
+    for (size_t i = 0; i < inForce.size(); ++i) {
+        if (rgAfter[i] == std::string::npos) {
+            blEdited = true;
+            reply.szBody += TableRow(inForce[i].szId, "removed", inForce[i], "not saved");
+            reply.jsAnswer["removed"].append(ToJson(inForce[i]));
+        }
+    }
+    return blEdited;
 }
 
 Reply ListRules() {
-    const auto rules = LoadRules();
-    if (!rules) {
-        return Failure(kUnreadable);
+    const auto inForce = LoadRules();
+    const auto rules = LoadDraft();
+    if (!inForce || !rules) {
+        return NeedsRoot().value_or(Unreadable());
     }
     Reply reply;
-    reply.jsAnswer["rules"] = Json::arrayValue;
     const Rule head{"", true, "proto", "router ports", "box ports", "", "name"};
-    reply.szBody = rules->empty() ? "" : Paint(Ink::kBold, TableRow("id", "state", head), STDOUT_FILENO);
-    for (const Rule& rule : *rules) {
-        reply.szBody += TableRow(rule.szId, rule.blEnabled ? "enabled" : "disabled", rule);
-        reply.jsAnswer["rules"].append(ToJson(rule));
-    }
+    reply.szBody =
+        rules->empty() && inForce->empty() ? "" : Paint(Ink::kBold, TableRow("id", "state", head, ""), STDOUT_FILENO);
+    const bool blEdited = ListEdited(*inForce, *rules, reply);
+    reply.jsAnswer["draft"] = blEdited;
+    reply.jsAnswer["off"] = IsOff();
     WarnOfOverlaps(*rules, reply);
-    if (rules->empty()) {
+    if (rules->empty() && inForce->empty()) {
         reply.szMessage =
-            "no rules are stored yet; add one, for example\n"
+            "no rules are stored yet; 'tavoportmap open 443' opens a port, or note a rule, for example\n"
             "  tavoportmap rules add web --router-port 443 --box-port 8443";
+    } else if (blEdited) {
+        reply.szMessage =
+            "not saved yet: 'tavoportmap save' brings it into force (--dry-run shows what that does), "
+            "'tavoportmap rules discard' drops it";
+    } else if (IsOff()) {
+        reply.szMessage = "every port is switched off; 'tavoportmap on' opens them again";
     }
+    return reply;
+}
+
+// ---- discard, import, export -------------------------------------------------------------------------------
+
+Reply Discard() {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
+    const Lock lock;
+    if (!lock.IsHeld()) {
+        return Busy();
+    }
+    const bool blAny = HasDraft();
+    if (!DropDraft()) {
+        return Failure("the edits could not be dropped; is /etc/portforward read-only?");
+    }
+    Reply reply{.szMessage = blAny ? "the edits are dropped; the rules are those in force"
+                                   : "there was nothing to drop: every edit is saved"};
+    reply.jsAnswer["dropped"] = blAny;
+    return reply;
+}
+
+Reply Import(const std::string& szPath, bool blReplace, bool blForce) {
+    std::ifstream file(szPath);
+    std::istream& stream = szPath == "-" ? std::cin : file;
+    const std::string szText(std::istreambuf_iterator<char>(stream), {});
+    if (!stream.good() && !stream.eof()) {
+        return {.enExit = kFailed, .szMessage = fmt::format("{} cannot be read", Clean(szPath))};
+    }
+    std::string szFault;
+    const auto imported = ReadImport(szText, szFault);
+    if (!imported) {
+        return {.enExit = kUsage, .szMessage = szFault + "\nNothing was changed"};
+    }
+    return ChangeRules([&](Rules& rules) -> Reply {
+        Rules rulesNew = blReplace ? Rules() : rules;
+        for (Rule rule : *imported) {
+            rule.szId = NextId(rulesNew);
+            rulesNew.push_back(rule);
+            const std::string szOverlap = blForce ? "" : FaultOfOverlap(rulesNew, rule.szId);
+            if (!szOverlap.empty()) {
+                return {.enExit = kUsage, .szMessage = szOverlap + "\nNothing was changed"};
+            }
+        }
+        rules = rulesNew;
+        Reply reply{.szMessage = fmt::format("{} rules noted, {}", imported->size(), kNext)};
+        reply.jsAnswer["imported"] = static_cast<Json::UInt>(imported->size());
+        return reply;
+    });
+}
+
+Reply Export() {
+    const auto rules = LoadDraft();
+    if (!rules) {
+        return NeedsRoot().value_or(Unreadable());
+    }
+    Reply reply;
+    Json::Value js;
+    js["rules"] = Json::arrayValue;
+    for (const Rule& rule : *rules) {
+        js["rules"].append(ToJson(rule));
+    }
+    reply.szBody = js.toStyledString();
+    reply.jsAnswer = js;
     return reply;
 }
 
@@ -178,7 +261,7 @@ void OfferAdd(CLI::App& rules, Request& request) {
     const auto pNew = std::make_shared<NewRule>();
     Rule& rule = pNew->rule;
     rule.szProtocol = "tcp";
-    CLI::App* pAdd = AddCommand(rules, "add", "store one more rule");
+    CLI::App* pAdd = AddCommand(rules, "add", "note one more rule");
     pAdd->add_option("name,--name", rule.szName, "what the rule is for");
     pAdd->add_option("--router-port", rule.szRouterPorts, "ports outside: 443, 80,443 or 5000-5010")
         ->type_name("PORTS")
@@ -188,7 +271,7 @@ void OfferAdd(CLI::App& rules, Request& request) {
     pAdd->add_option("--protocol", rule.szProtocol, "tcp, udp or all, which is both (default: tcp)")
         ->check(OneOf({"tcp", "udp", "all"}))
         ->type_name("WORD");
-    pAdd->add_flag("--disabled", pNew->blDisabled, "store it switched off");
+    pAdd->add_flag("--disabled", pNew->blDisabled, "note it switched off");
     pAdd->add_flag("--force", pNew->blForce, "also when another rule wants the same router port");
     pAdd->footer("Example: tavoportmap rules add web --router-port 443 --box-port 8443\n");
     pAdd->callback([pNew, &request] {
@@ -201,33 +284,110 @@ void OfferAdd(CLI::App& rules, Request& request) {
     });
 }
 
-void OfferChange(CLI::App& rules, Request& request, const std::string& szVerb, Change enChange,
-                 const std::string& szWhat) {
-    const auto pId = std::make_shared<std::string>();
+constexpr char kWhich[] = "the rule: its id, its name or its router port";
+
+void OfferChange(CLI::App& rules, Request& request, const std::string& szVerb, const std::string& szWhat,
+                 const std::function<std::string(Rule&)>& fnEdit, bool blRemove) {
+    const auto pWhich = std::make_shared<std::string>();
     const auto pForce = std::make_shared<bool>(false);
     CLI::App* pVerb = AddCommand(rules, szVerb, szWhat);
-    pVerb->add_option("id", *pId, "the rule's id, as 'rules list' shows it")->required();
-    if (enChange == Change::kEnable) {
+    pVerb->add_option("rule", *pWhich, kWhich)->required();
+    if (szVerb == "enable") {
         pVerb->add_flag("--force", *pForce, "also when another rule wants the same router port");
     }
-    pVerb->callback([pId, pForce, enChange, &request] {
-        request.fnCommand = [pId, pForce, enChange] { return ChangeRule(*pId, enChange, *pForce); };
+    pVerb->callback(
+        [=, &request] { request.fnCommand = [=] { return ChangeRule(*pWhich, *pForce, fnEdit, blRemove); }; });
+}
+
+struct Edit {
+    std::string szWhich;
+    Rule rule;
+    CLI::App* pApp = nullptr;
+    bool blForce = false;
+
+    bool Says(const char* szOption) const { return pApp->count(szOption) > 0; }
+};
+
+std::string Apply(const Edit& edit, Rule& rule) {
+    const bool blSamePorts = rule.szBoxPorts == rule.szRouterPorts;
+    if (edit.Says("--router-port")) {
+        rule.szRouterPorts = edit.rule.szRouterPorts;
+        rule.szBoxPorts = blSamePorts ? rule.szRouterPorts : rule.szBoxPorts;
+    }
+    rule.szBoxPorts = edit.Says("--box-port") ? edit.rule.szBoxPorts : rule.szBoxPorts;
+    rule.szProtocol = edit.Says("--protocol") ? edit.rule.szProtocol : rule.szProtocol;
+    rule.szName = edit.Says("--name") ? edit.rule.szName : rule.szName;
+    return FaultOf(rule);
+}
+
+void OfferEdit(CLI::App& rules, Request& request) {
+    const auto pEdit = std::make_shared<Edit>();
+    CLI::App* pVerb = pEdit->pApp = AddCommand(rules, "edit", "change ports, protocol or name of one rule");
+    pVerb->add_option("rule", pEdit->szWhich, kWhich)->required();
+    pVerb->add_option("--name", pEdit->rule.szName, "what the rule is for");
+    pVerb->add_option("--router-port", pEdit->rule.szRouterPorts, "ports outside: 443, 80,443 or 5000-5010")
+        ->type_name("PORTS");
+    pVerb->add_option("--box-port", pEdit->rule.szBoxPorts, "ports on this box, one for each of them")
+        ->type_name("PORTS");
+    pVerb->add_option("--protocol", pEdit->rule.szProtocol, "tcp, udp or all, which is both")
+        ->check(OneOf({"tcp", "udp", "all"}))
+        ->type_name("WORD");
+    pVerb->add_flag("--force", pEdit->blForce, "also when another rule wants the same router port");
+    pVerb->footer("Example: tavoportmap rules edit web --box-port 9443\n");
+    pVerb->callback([pEdit, &request] {
+        request.fnCommand = [pEdit]() -> Reply {
+            if (!pEdit->Says("--name") && !pEdit->Says("--router-port") && !pEdit->Says("--box-port") &&
+                !pEdit->Says("--protocol")) {
+                return {.enExit = kUsage,
+                        .szMessage = "nothing to change; for example\n  tavoportmap rules edit web --box-port 9443"};
+            }
+            return ChangeRule(
+                pEdit->szWhich, pEdit->blForce, [pEdit](Rule& rule) { return Apply(*pEdit, rule); }, false);
+        };
     });
+}
+
+void OfferFiles(CLI::App& rules, Request& request) {
+    AddCommand(rules, "discard", "drop the edits that are not saved yet")->callback([&request] {
+        request.fnCommand = &Discard;
+    });
+    const auto pPath = std::make_shared<std::string>();
+    const auto pReplace = std::make_shared<bool>(false);
+    const auto pForce = std::make_shared<bool>(false);
+    CLI::App* pImport = AddCommand(rules, "import", "note the rules of a JSON document, all of them or none");
+    pImport->add_option("file", *pPath, "the document, as 'rules export' writes it; - for standard input")->required();
+    pImport->add_flag("--replace", *pReplace, "in place of the rules that are there");
+    pImport->add_flag("--force", *pForce, "also when another rule wants the same router port");
+    pImport->footer(
+        "A rule is {\"router_ports\": \"443\"} at least; \"box_ports\", \"protocol\" (tcp), \"name\" and \"enabled\"\n"
+        "(true) may follow. The rules stand in a list, or in one under \"rules\".\n");
+    pImport->callback([=, &request] { request.fnCommand = [=] { return Import(*pPath, *pReplace, *pForce); }; });
+    AddCommand(rules, "export", "print the rules as a JSON document, those that are not saved, too")
+        ->callback([&request] { request.fnCommand = &Export; });
 }
 
 }  // namespace
 
 void OfferRules(CLI::App& app, Request& request) {
-    CLI::App* pRules = AddCommand(app, "rules", "the stored rules: list, add, remove, enable, disable");
+    CLI::App* pRules = AddCommand(app, "rules", "the rules: list, add, remove, enable, disable, edit, import, export");
     pRules->require_subcommand(1);
-    pRules->footer("The rules live in /etc/portforward/rule.conf; 'tavoportmap save' writes them to the router.\n");
-    AddCommand(*pRules, "list", "show the rules and which of them want the same port")->callback([&request] {
-        request.fnCommand = &ListRules;
-    });
+    pRules->footer(
+        "An edit stands aside until 'tavoportmap save' writes the rules to the router; 'rules discard'\n"
+        "drops it. 'tavoportmap open' and 'close' do it all at once for a port.\n");
+    AddCommand(*pRules, "list", "show the rules, what is not saved yet and which of them want the same port")
+        ->callback([&request] { request.fnCommand = &ListRules; });
     OfferAdd(*pRules, request);
-    OfferChange(*pRules, request, "remove", Change::kRemove, "forget one rule");
-    OfferChange(*pRules, request, "enable", Change::kEnable, "switch one rule on");
-    OfferChange(*pRules, request, "disable", Change::kDisable, "switch one rule off and keep it");
+    OfferChange(*pRules, request, "remove", "forget one rule", nullptr, true);
+    const auto fnSwitch = [](bool blOn) {
+        return [blOn](Rule& rule) {
+            rule.blEnabled = blOn;
+            return std::string();
+        };
+    };
+    OfferChange(*pRules, request, "enable", "switch one rule on", fnSwitch(true), false);
+    OfferChange(*pRules, request, "disable", "switch one rule off and keep it", fnSwitch(false), false);
+    OfferEdit(*pRules, request);
+    OfferFiles(*pRules, request);
 }
 
 }  // namespace tavo::cli

@@ -7,19 +7,17 @@
 #include "Box.h"
 #include "Capture.h"
 #include "Commands.h"
+#include "PortPairs.h"
 #include "Progress.h"
 #include "Reach.h"
 #include "RuleStore.h"
+#include "Test.h"
 
 namespace tavo::cli {
 
 namespace {
 
 constexpr size_t kMostSingles = 64;  // ports of one rule that get a line of their own
-
-std::vector<std::string> ProtocolsOf(const Rule& rule) {
-    return rule.szProtocol == "all" ? std::vector<std::string>{"tcp", "udp"} : std::vector{rule.szProtocol};
-}
 
 // The rule in as many parts as there are verdicts to give.
 Rules TakeApart(const Rule& rule) {
@@ -31,7 +29,7 @@ Rules TakeApart(const Rule& rule) {
     }
     Rules parts;
     for (size_t i = 0; i < rgRouter->size(); ++i) {
-        for (const std::string& szProtocol : ProtocolsOf(rule)) {
+        for (const std::string& szProtocol : ProtocolsOf(rule.szProtocol)) {
             parts.push_back(rule);
             parts.back().szProtocol = szProtocol;
             parts.back().szRouterPorts = std::to_string((*rgRouter)[i]);
@@ -102,18 +100,22 @@ Reply Test(const std::vector<std::string>& rgszIds, bool blJson) {
     if (!szMissing.empty()) {
         return NoSuchRule(*rules, szMissing);
     }
-    Rules parts;
-    for (const Rule& rule : chosen) {
-        const Rules more = TakeApart(rule);
-        parts.insert(parts.end(), more.begin(), more.end());
-    }
-    if (std::none_of(parts.begin(), parts.end(), [](const Rule& part) { return part.blEnabled; })) {
+    if (std::none_of(chosen.begin(), chosen.end(), [](const Rule& rule) { return rule.blEnabled; })) {
         return {.szMessage = "there is no rule to test that is switched on; 'tavoportmap rules list' shows them"};
     }
-    return TestParts(parts, blJson);
+    return TestRules(chosen, blJson);
 }
 
 }  // namespace
+
+Reply TestRules(const Rules& rules, bool blJson) {
+    Rules parts;
+    for (const Rule& rule : rules) {
+        const Rules more = TakeApart(rule);
+        parts.insert(parts.end(), more.begin(), more.end());
+    }
+    return TestParts(parts, blJson);
+}
 
 void OfferTest(CLI::App& app, Request& request) {
     const auto pIds = std::make_shared<std::vector<std::string>>();

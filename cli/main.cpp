@@ -49,6 +49,8 @@ Reply Answer(int argc, char** argv, Request& request) {
     app.set_help_flag("-h,--help", "print this help");
     app.set_version_flag("--version", "tavoportmap " TAVO_VERSION, "print the version");
     app.add_flag("--json", request.blJson, "answer with one JSON document");
+    OfferOpen(app, request);
+    OfferClose(app, request);
     OfferDetect(app, request);
     OfferRouter(app, request);
     OfferRouters(app, request);

@@ -1,0 +1,185 @@
+// "close", "off" and "on": ports closed at once, for good or for a while. Relies on the rules in force and on the save.
+// Promises: edits that are not saved stay so; what is closed on the router is said only when the router says so.
+#include <fmt/format.h>
+
+#include <algorithm>
+
+#include "Box.h"
+#include "Commands.h"
+#include "OpenPort.h"
+#include "PortNames.h"
+#include "SaveRules.h"
+#include "Usage.h"
+
+namespace tavo::cli {
+
+namespace {
+
+// Has fnChange change the rules in force and saves them. fnChange answers what there is to say when nothing is to be
+// saved; fnDone completes the reply to a save whose rules are in rule.conf.
+Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnChange,
+             const std::function<void(Reply&)>& fnDone) {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
+    const Lock lock;
+    if (!lock.IsHeld()) {
+        return Busy();
+    }
+    auto rules = LoadRules();
+    if (!rules) {
+        return Unreadable();
+    }
+    if (const auto reply = fnChange(*rules)) {
+        return *reply;
+    }
+    Reply reply = SaveRules(*rules, blJson);
+    if (AreStored(*rules)) {
+        fnDone(reply);
+    }
+    return reply;
+}
+
+// ---- close -------------------------------------------------------------------------------------------------
+
+// The ports that a word means: those of the rules with this name, else those that it says.
+std::vector<PortPair> Meant(const Rules& rules, const std::string& szWord) {
+    Rules named;
+    std::copy_if(rules.begin(), rules.end(), std::back_inserter(named),
+                 [&](const Rule& rule) { return !szWord.empty() && rule.szName == szWord; });
+    if (!named.empty()) {
+        return PairsOf(named);
+    }
+    const auto wish = ReadPortWish(szWord);
+    if (!wish) {
+        return {};
+    }
+    // Without a word for the protocol both are meant: what is closed is not opened by mistake.
+    const std::string szProtocol = szWord.find('/') == std::string::npos ? "all" : wish->szProtocol;
+    return PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""}).value_or(std::vector<PortPair>());
+}
+
+Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
+    std::string szWhat = Join(rgszWords);
+    size_t nClosed = 0;
+    const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
+        std::vector<PortPair> rgAll;
+        for (const std::string& szWord : rgszWords) {
+            const std::vector<PortPair> rgPairs = Meant(rules, szWord);
+            const bool blNamed = std::any_of(rules.begin(), rules.end(),
+                                             [&](const Rule& rule) { return rule.szName == szWord; });
+            if (rgPairs.empty() && !blNamed) {
+                Reply reply = NoSuchRule(rules, szWord);
+                reply.szMessage =
+                    fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap rules list' shows them",
+                                Clean(szWord));
+                return reply;
+            }
+            rgAll.insert(rgAll.end(), rgPairs.begin(), rgPairs.end());
+        }
+        nClosed = Close(rules, rgAll);
+        return nClosed > 0 ? std::nullopt
+                           : std::optional(Reply{.szMessage = fmt::format("nothing to close: no rule in force forwards {}",
+                                                                          Clean(szWhat))});
+    };
+    return Change(blJson, fnChange, [&](Reply& reply) {
+        reply.jsAnswer["closed"] = static_cast<Json::UInt>(nClosed);
+        if (reply.enExit == kOk) {
+            reply.szMessage = fmt::format("{} closed; {}", Clean(szWhat), reply.szMessage);
+        }
+    });
+}
+
+// ---- off, on -----------------------------------------------------------------------------------------------
+
+Reply Off(bool blJson) {
+    bool blNoted = false;
+    const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
+        Rules on;
+        std::copy_if(rules.begin(), rules.end(), std::back_inserter(on),
+                     [](const Rule& rule) { return rule.blEnabled; });
+        if (on.empty()) {
+            return Reply{.szMessage = IsOff() ? "every port is switched off already; 'tavoportmap on' opens them again"
+                                              : "nothing to switch off: no rule in force opens a port"};
+        }
+        if (!StoreOff(on)) {
+            return Failure("what to switch on again could not be noted in /etc/portforward; is the disk full or "
+                           "read-only? Nothing was changed");
+        }
+        blNoted = true;
+        for (Rule& rule : rules) {
+            rule.blEnabled = false;
+        }
+        return std::nullopt;
+    };
+    bool blStored = false;
+    Reply reply = Change(blJson, fnChange, [&](Reply& done) {
+        blStored = true;
+        if (done.enExit == kOk) {
+            done.szMessage = "every port is closed, and the rules are kept; 'tavoportmap on' opens them again";
+        }
+    });
+    if (blNoted && !blStored) {
+        DropOff();
+    }
+    reply.jsAnswer["off"] = IsOff();
+    return reply;
+}
+
+// Switches on what was on before. How many rules.
+size_t SwitchOn(Rules& rules, const Rules& before) {
+    size_t nOn = 0;
+    for (Rule rule : before) {
+        rule.blEnabled = false;
+        const auto pRule = std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
+            return !there.blEnabled && there.szId == rule.szId && IsSameContent(there, rule);
+        });
+        const auto pSame = pRule != rules.end() ? pRule
+                                                : std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
+                                                      return IsSameContent(there, rule);
+                                                  });
+        if (pSame != rules.end()) {
+            pSame->blEnabled = true;
+            ++nOn;
+        }
+    }
+    return nOn;
+}
+
+Reply On(bool blJson) {
+    const auto fnChange = [](Rules& rules) -> std::optional<Reply> {
+        const auto before = LoadOff();
+        if (!before) {
+            return Reply{.szMessage = "nothing to switch on: nothing was switched off by 'tavoportmap off'"};
+        }
+        if (SwitchOn(rules, *before) == 0) {
+            DropOff();
+            return Reply{.szMessage = "nothing to switch on: the rules that were switched off are gone"};
+        }
+        return std::nullopt;
+    };
+    Reply reply = Change(blJson, fnChange, [](Reply&) { DropOff(); });
+    reply.jsAnswer["off"] = IsOff();
+    return reply;
+}
+
+}  // namespace
+
+void OfferClose(CLI::App& app, Request& request) {
+    const auto pWords = std::make_shared<std::vector<std::string>>();
+    CLI::App* pClose = AddCommand(app, "close", "close ports, by number or by the name of a rule");
+    pClose->add_option("port", *pWords, "443, 5000-5010, 53/udp, or the name of a rule")->required();
+    pClose->footer(
+        "The port goes out of the rules in force; of a range the other ports stay. 'rules disable' and\n"
+        "'save' switch a rule off and keep it.\n");
+    pClose->callback(
+        [pWords, &request] { request.fnCommand = [pWords, &request] { return ClosePorts(*pWords, request.blJson); }; });
+    AddCommand(app, "off", "close every port of this box on the router, and keep the rules")->callback([&request] {
+        request.fnCommand = [&request] { return Off(request.blJson); };
+    });
+    AddCommand(app, "on", "open again what 'off' has closed")->callback([&request] {
+        request.fnCommand = [&request] { return On(request.blJson); };
+    });
+}
+
+}  // namespace tavo::cli

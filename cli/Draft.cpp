@@ -1,0 +1,287 @@
+// The edits that are not saved yet, and what 'off' remembers. Relies on jsoncpp. Promises: see RuleStore.h; a text
+// that is no UTF-8 survives the file.
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <memory>
+
+#include "Box.h"
+#include "RuleStore.h"
+#include "TextFile.h"
+
+namespace tavo::cli {
+
+namespace {
+
+constexpr char kDraft[] = "/etc/portforward/rule.conf.draft";
+constexpr char kOff[] = "/etc/portforward/rules.off";
+constexpr size_t kNone = std::string::npos;
+
+// ---- rules in JSON -----------------------------------------------------------------------------------------
+
+bool Parse(const std::string& szText, Json::Value& js) {
+    Json::CharReaderBuilder builder;
+    Json::CharReaderBuilder::strictMode(&builder.settings_);
+    const std::unique_ptr<Json::CharReader> pReader(builder.newCharReader());
+    return pReader->parse(szText.data(), szText.data() + szText.size(), &js, nullptr) && js.isObject();
+}
+
+std::string Format(const Json::Value& js) {
+    return Json::writeString(Json::StreamWriterBuilder(), js) + "\n";
+}
+
+// A text as it is, or the numbers of its bytes where JSON cannot hold it.
+Json::Value Lossless(const std::string& szText) {
+    Json::Value js, jsBack;
+    js["t"] = szText;
+    if (Parse(Format(js), jsBack) && jsBack["t"] == js["t"]) {
+        return js["t"];
+    }
+    Json::Value jsBytes = Json::arrayValue;
+    for (const char c : szText) {
+        jsBytes.append(static_cast<unsigned char>(c));
+    }
+    return jsBytes;
+}
+
+std::optional<std::string> TextOf(const Json::Value& js) {
+    if (js.isString()) {
+        return js.asString();
+    }
+    std::string szText;
+    for (const Json::Value& jsByte : js) {
+        if (!jsByte.isUInt() || jsByte.asUInt() > UINT8_MAX) {
+            return std::nullopt;
+        }
+        szText += static_cast<char>(jsByte.asUInt());
+    }
+    return js.isArray() ? std::optional(szText) : std::nullopt;
+}
+
+Json::Value ToFile(const Rules& rules) {
+    Json::Value jsRules = Json::arrayValue;
+    for (const Rule& rule : rules) {
+        Json::Value js;
+        js["id"] = Lossless(rule.szId);
+        js["enabled"] = rule.blEnabled;
+        js["protocol"] = Lossless(rule.szProtocol);
+        js["router_ports"] = Lossless(rule.szRouterPorts);
+        js["box_ports"] = Lossless(rule.szBoxPorts);
+        js["service_id"] = Lossless(rule.szServiceId);
+        js["name"] = Lossless(rule.szName);
+        jsRules.append(js);
+    }
+    return jsRules;
+}
+
+std::optional<Rules> FromFile(const Json::Value& jsRules) {
+    if (!jsRules.isArray()) {
+        return std::nullopt;
+    }
+    Rules rules;
+    for (const Json::Value& js : jsRules) {
+        if (!js.isObject() || !js["enabled"].isBool()) {
+            return std::nullopt;
+        }
+        Rule rule;
+        rule.blEnabled = js["enabled"].asBool();
+        for (const auto& [szKey, pSzField] :
+             std::initializer_list<std::pair<const char*, std::string*>>{{"id", &rule.szId},
+                                                                         {"protocol", &rule.szProtocol},
+                                                                         {"router_ports", &rule.szRouterPorts},
+                                                                         {"box_ports", &rule.szBoxPorts},
+                                                                         {"service_id", &rule.szServiceId},
+                                                                         {"name", &rule.szName}}) {
+            const auto szText = TextOf(js[szKey]);
+            if (!szText) {
+                return std::nullopt;
+            }
+            *pSzField = *szText;
+        }
+        rules.push_back(rule);
+    }
+    return rules;
+}
+
+// ---- comparing ---------------------------------------------------------------------------------------------
+
+bool IsSameList(const std::string& szOne, const std::string& szOther) {
+    const auto rgOne = ParsePorts(szOne);
+    return rgOne ? rgOne == ParsePorts(szOther) : szOne == szOther;
+}
+
+bool IsSameForward(const Rule& one, const Rule& other) {
+    return one.szProtocol == other.szProtocol && IsSameList(one.szRouterPorts, other.szRouterPorts) &&
+           IsSameList(one.szBoxPorts, other.szBoxPorts);
+}
+
+bool IsSameSet(const Rules& one, const Rules& other) {
+    return std::equal(one.begin(), one.end(), other.begin(), other.end(), [](const Rule& rule, const Rule& fellow) {
+        return rule.szId == fellow.szId && IsSameContent(rule, fellow);
+    });
+}
+
+// Pairs rules off, each at most once: by the first test as far as it goes, then by the next.
+std::vector<size_t> Pair(const Rules& one, const Rules& other,
+                         std::initializer_list<bool (*)(const Rule&, const Rule&)> rgTests) {
+    std::vector<size_t> rgFellows(one.size(), kNone);
+    std::vector<bool> rgTaken(other.size(), false);
+    for (const auto pfnTest : rgTests) {
+        for (size_t i = 0; i < one.size(); ++i) {
+            for (size_t j = 0; j < other.size() && rgFellows[i] == kNone; ++j) {
+                if (!rgTaken[j] && pfnTest(one[i], other[j])) {
+                    rgFellows[i] = j;
+                    rgTaken[j] = true;
+                }
+            }
+        }
+    }
+    return rgFellows;
+}
+
+// What the user changed, on what others changed.
+Rule Merged(const Rule& base, const Rule& edited, const Rule& current) {
+    Rule merged = current;
+    if (base.blEnabled != edited.blEnabled) {
+        merged.blEnabled = edited.blEnabled;
+    }
+    if (!IsSameForward(base, edited)) {  // ports go in pairs, so they change together
+        merged.szProtocol = edited.szProtocol;
+        merged.szRouterPorts = edited.szRouterPorts;
+        merged.szBoxPorts = edited.szBoxPorts;
+    }
+    merged.szName = base.szName != edited.szName ? edited.szName : merged.szName;
+    merged.szServiceId = base.szServiceId != edited.szServiceId ? edited.szServiceId : merged.szServiceId;
+    return merged;
+}
+
+// A rule that only the edits have, unless somebody else has made the same one.
+void Append(Rule rule, Rules& rules) {
+    if (std::any_of(rules.begin(), rules.end(), [&](const Rule& there) { return IsSameContent(there, rule); })) {
+        return;
+    }
+    if (std::any_of(rules.begin(), rules.end(), [&](const Rule& there) { return there.szId == rule.szId; })) {
+        rule.szId = NextId(rules);
+    }
+    rules.push_back(std::move(rule));
+}
+
+}  // namespace
+
+bool IsSameContent(const Rule& one, const Rule& other) {
+    return one.blEnabled == other.blEnabled && one.szName == other.szName && one.szServiceId == other.szServiceId &&
+           IsSameForward(one, other);
+}
+
+std::vector<size_t> Fellows(const Rules& one, const Rules& other) {
+    return Pair(
+        one, other,
+        {[](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId && IsSameContent(rule, fellow); },
+         [](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId; }});
+}
+
+Rules Rebase(const Rules& base, const Rules& edited, const Rules& current) {
+    const std::vector<size_t> rgBase = Pair(
+        current, base,
+        {[](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId && IsSameContent(rule, fellow); },
+         &IsSameContent, &IsSameForward});
+    const std::vector<size_t> rgEdited = Fellows(base, edited);
+    const std::vector<size_t> rgOrigin = Fellows(edited, base);
+    Rules rules;
+    for (size_t i = 0; i < current.size(); ++i) {
+        if (rgBase[i] == kNone) {
+            rules.push_back(current[i]);
+        } else if (const size_t nEdited = rgEdited[rgBase[i]]; nEdited != kNone) {
+            rules.push_back(Merged(base[rgBase[i]], edited[nEdited], current[i]));
+        }
+    }
+    for (size_t i = 0; i < edited.size(); ++i) {
+        const size_t nBase = rgOrigin[i];
+        // What others removed is gone, unless the user has changed it.
+        const bool blOnlyHere = nBase == kNone || (std::count(rgBase.begin(), rgBase.end(), nBase) == 0 &&
+                                                   !IsSameContent(base[nBase], edited[i]));
+        if (blOnlyHere) {
+            Append(edited[i], rules);
+        }
+    }
+    return rules;
+}
+
+// ---- the draft ---------------------------------------------------------------------------------------------
+
+std::optional<Rules> LoadDraft() {
+    const auto inForce = LoadRules();
+    std::string szText;
+    const ReadState enState = ReadOwnFile(kDraft, szText);
+    if (!inForce || enState == ReadState::kAbsent) {
+        return inForce;
+    }
+    Json::Value js;
+    if (enState == ReadState::kUnreadable || !Parse(szText, js)) {
+        return std::nullopt;
+    }
+    const auto base = FromFile(js["base"]);
+    const auto edited = FromFile(js["rules"]);
+    return base && edited ? std::optional(Rebase(*base, *edited, *inForce)) : std::nullopt;
+}
+
+bool HasDraft() {
+    std::string szText;
+    if (ReadOwnFile(kDraft, szText) == ReadState::kAbsent) {
+        return false;
+    }
+    const auto inForce = LoadRules();
+    const auto draft = LoadDraft();
+    return !inForce || !draft || !IsSameSet(*inForce, *draft);
+}
+
+bool StoreDraft(const Rules& rules) {
+    const auto inForce = LoadRules();
+    if (!inForce) {
+        return false;
+    }
+    if (IsSameSet(*inForce, rules)) {
+        return DropDraft();
+    }
+    Json::Value js;
+    js["base"] = ToFile(*inForce);
+    js["rules"] = ToFile(rules);
+    return WriteOwnFile(kDraft, Format(js));
+}
+
+bool DropDraft() {
+    return RemoveOwnFile(kDraft);
+}
+
+Reply Unreadable() {
+    return Failure(LoadRules() ? fmt::format("the edits that are not saved yet cannot be read ({}); 'tavoportmap rules "
+                                             "discard' drops them, and the rules in force stay as they are",
+                                             kDraft)
+                               : kUnreadable);
+}
+
+// ---- off ---------------------------------------------------------------------------------------------------
+
+std::optional<Rules> LoadOff() {
+    std::string szText;
+    Json::Value js;
+    const auto inForce = LoadRules();
+    const bool blClosed =
+        inForce && std::none_of(inForce->begin(), inForce->end(), [](const Rule& rule) { return rule.blEnabled; });
+    if (!blClosed || ReadOwnFile(kOff, szText) != ReadState::kRead || !Parse(szText, js)) {
+        return std::nullopt;
+    }
+    return FromFile(js["rules"]);
+}
+
+bool StoreOff(const Rules& rules) {
+    Json::Value js;
+    js["rules"] = ToFile(rules);
+    return WriteOwnFile(kOff, Format(js));
+}
+
+bool DropOff() {
+    return RemoveOwnFile(kOff);
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,188 @@
+// Compares the rules in force with those to be, and with the router's table. Relies on the seam's UPnP client.
+// Promises: see DryRun.h.
+#include "DryRun.h"
+
+#include <fmt/format.h>
+
+#include <map>
+
+#include "Box.h"
+#include "Outcome.h"
+#include "PortPairs.h"
+#include "SaveRules.h"
+#include "StoredRouter.h"
+#include "tavo/net.h"
+#include "tavo/upnp.h"
+
+namespace tavo::cli {
+
+namespace {
+
+constexpr int kSearchSeconds = 6;
+constexpr int kLocalPort = 55003;
+constexpr size_t kAddressSize = 64;
+constexpr int kMostEntries = 65536;
+
+// The router's table by "443/tcp"; nothing where it cannot be read.
+struct Table {
+    std::map<std::string, TAVO_UPNP_PORT_MAPPING> mapEntries;
+    std::string szBox;
+};
+
+std::optional<Table> ReadTable(const StoredRouter& router, const std::string& szGateway) {
+    char szBox[kAddressSize] = {};
+    if (router.enWay != Way::kUpnp ||
+        TAVONetLocalAddressGet(szGateway.c_str(), szBox, sizeof(szBox), nullptr, 0) != 0 ||
+        TAVOUpnpInit(kSearchSeconds, kLocalPort) != 0) {
+        return std::nullopt;
+    }
+    Table table{.mapEntries = {}, .szBox = szBox};
+    TAVO_UPNP_PORT_MAPPING mapping = {};
+    for (int i = 0; i < kMostEntries && TAVOUpnpPortMappingGet(i, &mapping) == 0; ++i) {
+        const std::string szProtocol = mapping.szProtocol;
+        if (mapping.nEnabled != 0 && !szProtocol.empty()) {
+            table.mapEntries.emplace(std::to_string(mapping.nExternalPort) + (szProtocol == "UDP" ? "/udp" : "/tcp"),
+                                     mapping);
+        }
+    }
+    TAVOUpnpCleanup();
+    return table;
+}
+
+struct Fate {
+    std::string szAction;  // "open", "close", "keep", "change", "refuse"
+    std::string szWhat;    // to the box's port
+    std::string szWhy;     // of a refusal
+
+    bool operator==(const Fate&) const = default;
+};
+
+// Each port with the box port that it leads to; of two rules that want one port the first has it.
+struct Wanted {
+    std::map<std::pair<std::string, int>, int> mapPorts;  // by protocol and router port
+    std::map<std::pair<std::string, int>, std::string> mapDoubles;
+};
+
+Wanted WantedBy(const Rules& rules) {
+    Wanted wanted;
+    std::map<std::pair<std::string, int>, std::string> mapOwners;
+    for (const Rule& rule : rules) {
+        const auto rgPairs = rule.blEnabled ? PairsOf(rule) : std::nullopt;
+        for (const PortPair& pair : rgPairs.value_or(std::vector<PortPair>())) {
+            const std::pair key(pair.szProtocol, pair.nRouter);
+            const auto [it, blNew] = wanted.mapPorts.try_emplace(key, pair.nBox);
+            if (blNew) {
+                mapOwners[key] = Clean(rule.szId);
+            } else if (it->second != pair.nBox) {
+                wanted.mapDoubles[key] = fmt::format(
+                    "rule {} wants it too, for another port of this box; rule {} comes "
+                    "first",
+                    Clean(rule.szId), mapOwners[key]);
+            }
+        }
+    }
+    return wanted;
+}
+
+// Another device that the router's table gives this port to.
+std::string Holder(const std::optional<Table>& table, const std::string& szPort) {
+    const auto it = table ? table->mapEntries.find(szPort) : decltype(table->mapEntries.end()){};
+    if (!table || it == table->mapEntries.end() || it->second.szInternalClient == table->szBox) {
+        return "";
+    }
+    const std::string szDescription = Clean(it->second.szDescription);
+    return fmt::format("another device has it on the router ({}{}{})", Clean(it->second.szInternalClient),
+                       szDescription.empty() ? "" : ", ", szDescription);
+}
+
+Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const Wanted& after,
+            const std::optional<Table>& table) {
+    const auto itBefore = before.mapPorts.find(key);
+    const auto itAfter = after.mapPorts.find(key);
+    if (itAfter == after.mapPorts.end()) {
+        return {"close", "", ""};
+    }
+    const std::string szTo =
+        itAfter->second == key.second ? "" : fmt::format("to port {} of this box", itAfter->second);
+    if (const std::string szHolder = Holder(table, fmt::format("{}/{}", key.second, key.first)); !szHolder.empty()) {
+        return {"refuse", szTo, szHolder};
+    }
+    if (const auto itDouble = after.mapDoubles.find(key); itDouble != after.mapDoubles.end()) {
+        return {"refuse", szTo, itDouble->second};
+    }
+    return {itBefore == before.mapPorts.end()     ? "open"
+            : itBefore->second == itAfter->second ? "keep"
+                                                  : "change",
+            szTo, ""};
+}
+
+void AddLine(const std::string& szProtocol, int nFirst, int nLast, const Fate& fate, Reply& reply) {
+    const std::string szPorts = nFirst == nLast ? std::to_string(nFirst) : fmt::format("{}-{}", nFirst, nLast);
+    const std::string szMore = fate.szWhat + (fate.szWhat.empty() || fate.szWhy.empty() ? "" : ": ") + fate.szWhy;
+    reply.szBody += fmt::format("{:<8}{:<16}{}\n", fate.szAction, szPorts + "/" + szProtocol, szMore);
+    Json::Value js;
+    js["action"] = fate.szAction;
+    js["router_ports"] = szPorts;
+    js["protocol"] = szProtocol;
+    js["why"] = fate.szWhy.empty() ? Json::Value() : Json::Value(fate.szWhy);
+    reply.jsAnswer["ports"].append(js);
+}
+
+// Neighbours with the same fate share a line; those that lead to other ports than their own are told one by one.
+// Whether any stays out.
+bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<Table>& table, Reply& reply) {
+    std::map<std::pair<std::string, int>, Fate> mapFates;
+    for (const auto* pWanted : {&before, &after}) {
+        for (const auto& [key, nBox] : pWanted->mapPorts) {
+            mapFates.try_emplace(key, FateOf(key, before, after, table));
+        }
+    }
+    bool blRefused = false;
+    for (auto it = mapFates.begin(); it != mapFates.end();) {
+        const auto& [szProtocol, nFirst] = it->first;
+        const Fate& fate = it->second;
+        int nLast = nFirst;
+        for (++it; it != mapFates.end() && it->first == std::pair(szProtocol, nLast + 1) && it->second == fate; ++it) {
+            ++nLast;
+        }
+        AddLine(szProtocol, nFirst, nLast, fate, reply);
+        blRefused = blRefused || fate.szAction == "refuse";
+    }
+    return blRefused;
+}
+
+}  // namespace
+
+Reply DryRunOf(const Rules& inForce, const Rules& rules) {
+    const auto szGateway = Gateway();
+    if (!szGateway) {
+        return NoGateway();
+    }
+    const StoredRouter router = ReadStoredRouter();
+    if (const auto refused = WouldBeRefused(router, *szGateway, rules)) {
+        return *refused;
+    }
+    Reply reply;
+    reply.jsAnswer["ports"] = Json::arrayValue;
+    const auto table = ReadTable(router, *szGateway);
+    const bool blRefused = AddPorts(WantedBy(inForce), WantedBy(rules), table, reply);
+    reply.jsAnswer["table_read"] = table.has_value();
+    if (!table) {
+        reply.rgszWarnings.emplace_back(
+            router.enWay == Way::kUpnp
+                ? "the router did not show its table, so whether another device has a port is not known"
+                : "a router that is not driven by UPnP does not show who has a port before it is asked for it");
+    }
+    for (const Rule& rule : rules) {
+        if (rule.blEnabled && !PairsOf(rule)) {
+            reply.rgszWarnings.push_back(
+                fmt::format("the ports of rule {} cannot be read or paired; it would be refused", Clean(rule.szId)));
+        }
+    }
+    reply.enExit = blRefused ? kRefused : kOk;
+    reply.szMessage = blRefused ? "some ports would stay out; nothing was changed"
+                                : "this is what 'tavoportmap save' would do; nothing was changed";
+    return reply;
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,138 @@
+// Puts the daemon's word on a save into words. Relies on Published.h. Promises: see Outcome.h.
+#include "Outcome.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+
+namespace tavo::cli {
+
+namespace {
+
+const char* ProgramOf(const StoredRouter& router) {
+    return router.enWay == Way::kNatpmp ? "natpmpd" : router.enWay == Way::kUpnp ? "upnpd" : "tavoportforward";
+}
+
+struct Cause {
+    const char* szRouter;
+    const char* szWhat;
+    const char* szDo;
+};
+
+// What keeps a router from being asked; each with what helps.
+constexpr Cause kCauses[] = {
+    {"unreachable", "the router {} cannot be reached", "look at its power and at the cable, or at the Wi-Fi"},
+    {"no_gateway", "this box has no default gateway any more", "'ip route' shows the routes; is the cable plugged in?"},
+    {"no_upnp", "the router {} is there, but does not offer UPnP",
+     "switch UPnP on in its own pages (http://{}/), or 'tavoportmap setup' looks for another way"},
+    {"no_natpmp", "the router {} is there, but does not offer NAT-PMP",
+     "switch it on in its own pages (http://{}/), or 'tavoportmap setup' looks for another way"},
+    {"silent", "the router {} does not answer", "often it helps to restart the router"},
+};
+
+// Nothing when the router was spoken to.
+std::optional<std::string> WhyAway(const Published& published, const std::string& szGateway) {
+    const auto pCause = std::find_if(std::begin(kCauses), std::end(kCauses),
+                                     [&](const Cause& cause) { return published.szRouter == cause.szRouter; });
+    if (pCause == std::end(kCauses)) {
+        return std::nullopt;
+    }
+    const std::string szWhat = fmt::format(fmt::runtime(pCause->szWhat), szGateway);
+    const std::string szDo = fmt::format(fmt::runtime(pCause->szDo), szGateway);
+    return fmt::format(
+        "{}: nothing was refused, and nothing is known to be open. The rules are stored, and the daemon goes on trying "
+        "until it is back\n{}; 'tavoportmap status' shows how it is",
+        szWhat, szDo);
+}
+
+std::string StateWords(const PublishedRule& rule) {
+    switch (rule.enState) {
+        case PortState::kOpen:
+            return "open";
+        case PortState::kRefused:
+            return "refused";
+        case PortState::kWaiting:
+            return "not yet";
+        default:
+            return "unknown";
+    }
+}
+
+size_t NotOpen(const Published& published) {
+    return static_cast<size_t>(std::count_if(published.rgRules.begin(), published.rgRules.end(),
+                                             [](const PublishedRule& r) { return r.enState != PortState::kOpen; }));
+}
+
+}  // namespace
+
+std::string Count(int64_t nCount, const std::string& szWhat) {
+    return nCount <= 0 ? fmt::format("no {}s", szWhat) : fmt::format("{} {}{}", nCount, szWhat, nCount == 1 ? "" : "s");
+}
+
+std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSince) {
+    auto published = ReadPublished(ProgramOf(router));
+    return published && published->nAt >= nSince ? published : std::nullopt;
+}
+
+std::string WhoHas(const PublishedRule& rule) {
+    if (!rule.holder || rule.holder->szAddress.empty()) {
+        return "";
+    }
+    const std::string szWhat = Clean(rule.holder->szDescription);
+    return fmt::format(" ({}{}{})", Clean(rule.holder->szAddress), szWhat.empty() ? "" : ", ", szWhat);
+}
+
+void AddPorts(const Published& published, bool blAll, Reply& reply) {
+    reply.jsAnswer["ports"] = Json::arrayValue;
+    for (const PublishedRule& rule : published.rgRules) {
+        const bool blOpen = rule.enState == PortState::kOpen;
+        if (blAll || !blOpen) {
+            reply.szBody += fmt::format("{:<12} {}{}{}{}\n", Clean(rule.szName), StateWords(rule),
+                                        rule.szWhy.empty() ? "" : ": ", Clean(rule.szWhy), WhoHas(rule));
+        }
+        Json::Value js;
+        js["name"] = rule.szName;
+        js["state"] = ToWord(rule.enState);
+        js["why"] = rule.szWhy.empty() ? Json::Value() : Json::Value(rule.szWhy);
+        if (rule.holder) {
+            js["holder"]["address"] = rule.holder->szAddress;
+            js["holder"]["description"] = rule.holder->szDescription;
+        }
+        reply.jsAnswer["ports"].append(js);
+    }
+    for (const PublishedLeftOver& left : published.rgLeftOver) {
+        reply.szBody += fmt::format("{:<12} still on the router: {}\n", Clean(left.szName), Clean(left.szWhy));
+        Json::Value js;
+        js["name"] = left.szName;
+        js["why"] = left.szWhy;
+        reply.jsAnswer["left_over"].append(js);
+    }
+}
+
+Reply OutcomeOf(const Published& published, const Rules& rules, const std::string& szGateway) {
+    Reply reply;
+    const auto nOn = std::count_if(rules.begin(), rules.end(), [](const Rule& rule) { return rule.blEnabled; });
+    if (const auto szAway = WhyAway(published, szGateway)) {
+        AddPorts(published, false, reply);
+        reply.szBody.clear();  // the same for each of them
+        reply.enExit = kAway;
+        reply.szMessage = *szAway;
+        return reply;
+    }
+    AddPorts(published, false, reply);
+    const size_t nNot = NotOpen(published);
+    const size_t nLeft = published.rgLeftOver.size();
+    reply.enExit = nNot + nLeft > 0 ? kRefused : kOk;
+    reply.szMessage =
+        nNot > 0 ? fmt::format(
+                       "{} not open on the router; the others are in force. Choose other router ports for them "
+                       "('tavoportmap rules edit'), or free them there",
+                       Count(static_cast<int64_t>(nNot), "port"))
+        : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; the daemon goes on trying",
+                                  Count(static_cast<int64_t>(nLeft), "port"))
+        : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
+                    : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
+    return reply;
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,28 @@
+// What a save came to on the router, by the word of the daemon that carried it out. Relies on Published.h.
+// Promises: a router that did not answer is not one that refused; who has a port is named.
+#pragma once
+
+#include <ctime>
+#include <optional>
+
+#include "Answer.h"
+#include "Published.h"
+#include "RuleStore.h"
+#include "StoredRouter.h"
+
+namespace tavo::cli {
+
+// What the daemon that drives this router has published since then; nothing when it says nothing.
+std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSince);
+
+// "443/tcp refused: another device has this port on the router (192.168.1.7, console)", as a line; and as JSON.
+void AddPorts(const Published& published, bool blAll, Reply& reply);
+std::string WhoHas(const PublishedRule& rule);
+
+// What is so now that rules have been saved.
+Reply OutcomeOf(const Published& published, const Rules& rules, const std::string& szGateway);
+
+// "1 rule", "no rules"; never a negative number.
+std::string Count(int64_t nCount, const std::string& szWhat);
+
+}  // namespace tavo::cli

@@ -1,0 +1,96 @@
+// Reads and replaces the tool's own files. Relies on POSIX files. Promises: see TextFile.h.
+#include "TextFile.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+
+namespace tavo::cli {
+
+namespace {
+
+constexpr off_t kMostBytes = 4 << 20;
+constexpr mode_t kOwnerOnly = 0600;
+
+class File {
+public:
+    explicit File(int fd) : mFd(fd) {}
+    ~File() { Close(); }
+    File(const File&) = delete;
+    File& operator=(const File&) = delete;
+    int Fd() const { return mFd; }
+    bool Close() {
+        const bool blClosed = mFd < 0 || close(mFd) == 0;
+        mFd = -1;
+        return blClosed;
+    }
+
+private:
+    int mFd;
+};
+
+bool IsOwn(const struct stat& status) {
+    return S_ISREG(status.st_mode) && (status.st_uid == 0 || status.st_uid == geteuid()) &&
+           (status.st_mode & (S_IWGRP | S_IWOTH)) == 0 && status.st_size <= kMostBytes;
+}
+
+bool WriteAll(int fd, const std::string& szText) {
+    for (size_t nDone = 0; nDone < szText.size();) {
+        const ssize_t nWritten = write(fd, szText.data() + nDone, szText.size() - nDone);
+        if (nWritten < 0 && errno != EINTR) {
+            return false;
+        }
+        nDone += nWritten < 0 ? 0 : static_cast<size_t>(nWritten);
+    }
+    return true;
+}
+
+// A name in a directory lasts only when the directory has been written, too.
+void FlushDirectoryOf(const std::string& szPath) {
+    const File directory(open(szPath.substr(0, szPath.rfind('/') + 1).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (directory.Fd() >= 0) {
+        fsync(directory.Fd());
+    }
+}
+
+}  // namespace
+
+ReadState ReadOwnFile(const std::string& szPath, std::string& szText) {
+    const File file(open(szPath.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    if (file.Fd() < 0) {
+        return errno == ENOENT ? ReadState::kAbsent : ReadState::kUnreadable;
+    }
+    struct stat status = {};
+    if (fstat(file.Fd(), &status) != 0 || !IsOwn(status)) {
+        return ReadState::kUnreadable;
+    }
+    szText.assign(static_cast<size_t>(status.st_size), '\0');
+    return read(file.Fd(), szText.data(), szText.size()) == status.st_size ? ReadState::kRead : ReadState::kUnreadable;
+}
+
+bool WriteOwnFile(const std::string& szPath, const std::string& szText) {
+    const std::string szNew = szPath + ".new";
+    unlink(szNew.c_str());  // of a writer that was killed
+    File file(open(szNew.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kOwnerOnly));
+    if (file.Fd() < 0) {
+        return false;
+    }
+    if (!WriteAll(file.Fd(), szText) || fsync(file.Fd()) != 0 || !file.Close() ||
+        std::rename(szNew.c_str(), szPath.c_str()) != 0) {
+        unlink(szNew.c_str());
+        return false;
+    }
+    FlushDirectoryOf(szPath);
+    return true;
+}
+
+bool RemoveOwnFile(const std::string& szPath) {
+    const bool blGone = unlink(szPath.c_str()) == 0 || errno == ENOENT;
+    FlushDirectoryOf(szPath);
+    return blGone;
+}
+
+}  // namespace tavo::cli

@@ -1,0 +1,19 @@
+// The tool's own files beside the library's. Relies on POSIX files. Promises: a reader sees the whole old text or the
+// whole new one, also after a power cut; a file that others could have written is not read.
+#pragma once
+
+#include <optional>
+#include <string>
+
+namespace tavo::cli {
+
+enum class ReadState { kRead, kAbsent, kUnreadable };
+
+// A plain file of root's (or this user's) that nobody else may write, of 4 MiB at most.
+ReadState ReadOwnFile(const std::string& szPath, std::string& szText);
+// Replaces it, for its owner alone. False: the old one is still there.
+bool WriteOwnFile(const std::string& szPath, const std::string& szText);
+// True when it is gone.
+bool RemoveOwnFile(const std::string& szPath);
+
+}  // namespace tavo::cli
