@@ -66,8 +66,8 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
         std::vector<PortPair> rgAll;
         for (const std::string& szWord : rgszWords) {
             const std::vector<PortPair> rgPairs = Meant(rules, szWord);
-            const bool blNamed = std::any_of(rules.begin(), rules.end(),
-                                             [&](const Rule& rule) { return rule.szName == szWord; });
+            const bool blNamed =
+                std::any_of(rules.begin(), rules.end(), [&](const Rule& rule) { return rule.szName == szWord; });
             if (rgPairs.empty() && !blNamed) {
                 Reply reply = NoSuchRule(rules, szWord);
                 reply.szMessage =
@@ -79,8 +79,8 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
         }
         nClosed = Close(rules, rgAll);
         return nClosed > 0 ? std::nullopt
-                           : std::optional(Reply{.szMessage = fmt::format("nothing to close: no rule in force forwards {}",
-                                                                          Clean(szWhat))});
+                           : std::optional(Reply{.szMessage = fmt::format(
+                                                     "nothing to close: no rule in force forwards {}", Clean(szWhat))});
     };
     return Change(blJson, fnChange, [&](Reply& reply) {
         reply.jsAnswer["closed"] = static_cast<Json::UInt>(nClosed);
@@ -103,8 +103,9 @@ Reply Off(bool blJson) {
                                               : "nothing to switch off: no rule in force opens a port"};
         }
         if (!StoreOff(on)) {
-            return Failure("what to switch on again could not be noted in /etc/portforward; is the disk full or "
-                           "read-only? Nothing was changed");
+            return Failure(
+                "what to switch on again could not be noted in /etc/portforward; is the disk full or "
+                "read-only? Nothing was changed");
         }
         blNoted = true;
         for (Rule& rule : rules) {
@@ -134,10 +135,10 @@ size_t SwitchOn(Rules& rules, const Rules& before) {
         const auto pRule = std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
             return !there.blEnabled && there.szId == rule.szId && IsSameContent(there, rule);
         });
-        const auto pSame = pRule != rules.end() ? pRule
-                                                : std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
-                                                      return IsSameContent(there, rule);
-                                                  });
+        const auto pSame =
+            pRule != rules.end() ? pRule : std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
+                return IsSameContent(there, rule);
+            });
         if (pSame != rules.end()) {
             pSame->blEnabled = true;
             ++nOn;

@@ -2,11 +2,10 @@
 // test from outside. Promises: only this port is opened, whatever edits are waiting; what was not looked at is not
 // called open; a port that should not face the world is not opened without a word.
 #include <fmt/format.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <iostream>
 
+#include "Ask.h"
 #include "Box.h"
 #include "Commands.h"
 #include "Listeners.h"
@@ -47,18 +46,14 @@ std::string MakeRule(const OpenWish& wish, Rule& rule) {
     }
     rule.szRouterPorts = ports->szPorts;
     rule.szBoxPorts = wish.szTo.empty() ? ports->szPorts : wish.szTo;
-    rule.szProtocol = !wish.szProtocol.empty() ? wish.szProtocol : ports->szProtocol.empty() ? "tcp" : ports->szProtocol;
+    rule.szProtocol = !wish.szProtocol.empty()    ? wish.szProtocol
+                      : ports->szProtocol.empty() ? "tcp"
+                                                  : ports->szProtocol;
     rule.szName = wish.szName.empty() ? ports->szName : wish.szName;
     return FaultOf(rule);
 }
 
 // ---- before ------------------------------------------------------------------------------------------------
-
-bool Confirm(const std::string& szQuestion) {
-    std::cerr << szQuestion << " [y/N] " << std::flush;
-    std::string szAnswer;
-    return std::getline(std::cin, szAnswer) && !szAnswer.empty() && (szAnswer[0] == 'y' || szAnswer[0] == 'Y');
-}
 
 // Why the user does not want this after all; nothing when he does.
 std::optional<Reply> Dissuade(const Rule& rule, bool blYes, bool blJson) {
@@ -71,7 +66,7 @@ std::optional<Reply> Dissuade(const Rule& rule, bool blYes, bool blJson) {
         return std::nullopt;
     }
     const std::string szRisks = fmt::format("{}", fmt::join(rgszRisks, "\n"));
-    if (!blJson && isatty(STDIN_FILENO) != 0 && isatty(STDERR_FILENO) != 0) {
+    if (!blJson && IsAnybodyThere()) {
         return Confirm(szRisks + "\nOpen it to everybody on the Internet all the same?")
                    ? std::nullopt
                    : std::optional(Reply{.enExit = kFailed, .szMessage = "nothing was changed"});
@@ -100,7 +95,8 @@ Reply SaveOpening(const Rule& rule, bool& blAlready, bool blJson) {
     blAlready = opening.blAlready;
     Reply reply = SaveRules(opening.rules, blJson);
     if (reply.enExit != kOk && AreStored(opening.rules) && !blAlready) {
-        reply.szMessage += fmt::format("\nThe rule stays; 'tavoportmap close {}' takes it back", Clean(rule.szRouterPorts));
+        reply.szMessage +=
+            fmt::format("\nThe rule stays; 'tavoportmap close {}' takes it back", Clean(rule.szRouterPorts));
     }
     return reply;
 }
@@ -126,10 +122,9 @@ std::string ListenWords(const std::vector<Listener>& rgListeners, const PortPair
     }
     jsPort["listens"] = Json::Value();
     jsPort["loopback_only"] = !szLoopback.empty();
-    return !szLoopback.empty()
-               ? szLoopback
-               : fmt::format("no program of this box waits at {} port {} yet, so nobody answers there", pair.szProtocol,
-                             pair.nBox);
+    return !szLoopback.empty() ? szLoopback
+                               : fmt::format("no program of this box waits at {} port {} yet, so nobody answers there",
+                                             pair.szProtocol, pair.nBox);
 }
 
 void AddListeners(const Rule& rule, Reply& reply) {
@@ -190,7 +185,8 @@ void AddOutside(const Rule& rule, bool blJson, Reply& reply) {
     reply.jsAnswer["tested"] = Json::Value();
     if (!IsCheckerNamed()) {
         reply.szBody +=
-            "try it from elsewhere, such as a phone without Wi-Fi; nobody outside was asked, as no port checker is named "
+            "try it from elsewhere, such as a phone without Wi-Fi; nobody outside was asked, as no port checker is "
+            "named "
             "('tavoportmap test --help')\n";
         return;
     }

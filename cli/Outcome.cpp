@@ -123,11 +123,13 @@ Reply OutcomeOf(const Published& published, const Rules& rules, const std::strin
     const size_t nNot = NotOpen(published);
     const size_t nLeft = published.rgLeftOver.size();
     reply.enExit = nNot + nLeft > 0 ? kRefused : kOk;
+    const std::string szOthers =
+        nNot == published.rgRules.size() ? "and no other one is asked for" : "the others are in force";
     reply.szMessage =
         nNot > 0 ? fmt::format(
-                       "{} not open on the router; the others are in force. Choose other router ports for them "
-                       "('tavoportmap rules edit'), or free them there",
-                       Count(static_cast<int64_t>(nNot), "port"))
+                       "{} not open on the router; {}. Choose other router ports ('tavoportmap rules edit'), or "
+                       "free them there",
+                       Count(static_cast<int64_t>(nNot), "port"), szOthers)
         : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; the daemon goes on trying",
                                   Count(static_cast<int64_t>(nLeft), "port"))
         : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)

@@ -4,6 +4,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <functional>
 #include <memory>
 
 #include "PortNames.h"
@@ -157,7 +158,8 @@ Choice Choose(const Rules& rules, const std::string& szWhich) {
             return {.szFault = fmt::format("several rules forward '{}': say which by its id ({})", Clean(szWhich),
                                            Ids(rules, rgFound))};
         }
-        if (!rgFound.empty() && PairsOf(rules[rgFound.front()])->size() > 2 * rgPairs->size()) {
+        if (!rgFound.empty() &&
+            ParsePorts(rules[rgFound.front()].szRouterPorts)->size() > ParsePorts(wish->szPorts)->size()) {
             return {.szFault = fmt::format("rule {} forwards more than '{}': name it by its id to change all of it, or "
                                            "'tavoportmap close {}' closes that port alone",
                                            Clean(rules[rgFound.front()].szId), Clean(szWhich), Clean(szWhich))};

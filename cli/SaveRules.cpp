@@ -206,7 +206,7 @@ int CallLibrary(const std::string& szGateway, std::vector<__tag_TAVO_ROUTER_RULE
         },
         &progress);
     if (nResult == 0 && rgRecords.empty()) {
-        WaitFor(kTakenAway, [] { return IsSavingRules() == 0; });
+        AwaitDaemon();
     }
     return nResult;
 }
@@ -242,6 +242,10 @@ std::optional<Reply> WouldBeRefused(const StoredRouter& router, const std::strin
     return ToRecords(rules) ? Refused(router, szGateway, rules, result) : std::optional(TooLong());
 }
 
+void AwaitDaemon() {
+    WaitFor(kTakenAway, [] { return IsSavingRules() == 0; });
+}
+
 bool AreStored(const Rules& rules) {
     const auto stored = LoadRules();
     return stored && std::equal(stored->begin(), stored->end(), rules.begin(), rules.end(),
@@ -251,7 +255,9 @@ bool AreStored(const Rules& rules) {
 Reply SaveRules(const Rules& rules, bool blJson) {
     const auto szGateway = Gateway();
     if (!szGateway) {
-        return NoGateway();
+        Reply reply = NoGateway();
+        reply.enExit = kAway;
+        return reply;
     }
     auto rgRecords = ToRecords(rules);
     if (!rgRecords) {

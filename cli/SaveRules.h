@@ -15,6 +15,9 @@ Reply SaveRules(const Rules& rules, bool blJson);
 // What the router would refuse as a whole, as it would be said; nothing when it would not.
 std::optional<Reply> WouldBeRefused(const StoredRouter& router, const std::string& szGateway, const Rules& rules);
 
+// Waits, for a minute at most, until the daemon has carried out what it was told.
+void AwaitDaemon();
+
 // Whether these rules, and no others, are in rule.conf.
 bool AreStored(const Rules& rules);
 

@@ -12,10 +12,13 @@
 #include "Commands.h"
 #include "CompatTest.h"
 #include "KeysGuard.h"
+#include "Outcome.h"
 #include "Progress.h"
 #include "Reach.h"
+#include "SaveRules.h"
 #include "ServicePlan.h"
 #include "Settings.h"
+#include "StoredRouter.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -93,6 +96,9 @@ void CheckCapacity(Surroundings& found) {
 
 // What is known before anything is done.
 Reply LookAround(const Wish& wish, Surroundings& found) {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     if (const Reply reply = ReadRequests(wish, found.rgRequests); reply.enExit != kOk) {
         return reply;
     }
@@ -100,12 +106,23 @@ Reply LookAround(const Wish& wish, Surroundings& found) {
     if (settings.obstacle) {
         return *settings.obstacle;
     }
+    const auto rules = LoadRules();
     const auto rgStored = LoadRecords();
-    if (!rgStored) {
-        return Failure(kUnreadable);
+    if (!rules || !rgStored) {
+        return NeedsRoot().value_or(Unreadable());
+    }
+    if (!ToRecords(*rules)) {
+        return Failure(
+            "a name or a port list of a rule is longer than 1023 bytes and would be cut: 'tavoportmap rules list' "
+            "shows "
+            "it, 'rules edit' changes it. Nothing was changed");
     }
     found.rgStored = *rgStored;
     found.router = ReadServiceRouter(settings);
+    if (const auto szWhy = WhyUnsavable(ReadStoredRouter(), settings.szGateway);
+        szWhy && found.router.szRefusal.empty()) {
+        found.router.szRefusal = *szWhy;
+    }
     const bool blAskUpnp =
         found.router.blUpnp && found.router.szRefusal.empty() && !(found.rgRequests.empty() && rgStored->empty());
     const auto used = blAskUpnp ? AskRouter() : std::nullopt;
@@ -119,11 +136,11 @@ Reply LookAround(const Wish& wish, Surroundings& found) {
     return {};
 }
 
+constexpr char kCut[] =
+    "a rule's list of ports would get longer than a rule can hold, and lose its end: ask for fewer pieces";
+
 // What a user must agree to with --force; empty when there is nothing.
 std::string Objection(const Wish& wish, const Surroundings& found) {
-    if (found.plan.blCut) {
-        return "a rule's list of ports would get longer than a rule can hold, and lose its end: ask for fewer pieces";
-    }
     for (const __tag_TAVO_ROUTER_RULE& rule : found.rgStored) {
         // A service forwards each port to the same port of the box, and nothing else.
         if (wish.szService == rule.szServiceName && std::string(rule.szRouterPort) != rule.szSrcPort) {
@@ -184,7 +201,7 @@ Reply Plan(const Wish& wish) {
         reply.szMessage =
             fmt::format("there would be {} rules, numbered from 1; nothing was changed", found.plan.after.size());
     }
-    if (const std::string szFault = Objection(wish, found); !szFault.empty()) {
+    if (const std::string szFault = found.plan.blCut ? kCut : Objection(wish, found); !szFault.empty()) {
         reply.rgszWarnings.push_back(szFault);
     }
     return reply;
@@ -204,18 +221,26 @@ bool IsStored(const Rules& after) {
 }
 
 // Why the library answered -1.
-Reply NotSet(const Surroundings& found, const std::string& szLog) {
+Reply NotSet(const Surroundings& found, const std::string& szLog, time_t nStart) {
     if (szLog.find("save rule failed") == std::string::npos && szLog.find(" test ") != std::string::npos) {
         return Failure("the rules are in force, but their ports could not be tested; the system log says why");
     }
     if (!found.plan.szRefusal.empty()) {
         return Failure(fmt::format("nothing was changed: {}", found.plan.szRefusal));
     }
-    return Failure(IsStored(found.plan.after)
-                       ? "the rules are stored, but the router did not take them all, or its daemon did not answer; "
-                         "'tavoportmap save' tries again and says which"
-                       : "the request failed; 'tavoportmap service plan' shows what it meets, and the system log says "
-                         "why");
+    if (!IsStored(found.plan.after)) {
+        return Failure(
+            "the request failed, and the rules are as they were; 'tavoportmap service plan' shows what it meets, and "
+            "the "
+            "system log says why");
+    }
+    const auto published = PublishedSince(ReadStoredRouter(), nStart);
+    Reply reply = published ? OutcomeOf(*published, found.plan.after, published->szGateway)
+                            : Failure(
+                                  "the rules are stored, but the router did not take them all, or its daemon did not "
+                                  "answer; 'tavoportmap save' tries again and says which");
+    reply.enExit = reply.enExit == kOk ? kFailed : reply.enExit;
+    return reply;
 }
 
 void AddTested(const Wish& wish, const Requests& rgRequests, const std::string& szLog, Reply& reply) {
@@ -228,8 +253,10 @@ void AddTested(const Wish& wish, const Requests& rgRequests, const std::string& 
     DescribePorts(rgVerdicts, reply);
 }
 
-Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& szLog) {
+Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& szLog, time_t nStart) {
     Reply reply;
+    AwaitDaemon();  // the library does not, for rules that leave none
+    const auto published = PublishedSince(ReadStoredRouter(), nStart);
     const bool blAll = Describe(found.plan, reply);
     if (wish.blTest && !found.rgRequests.empty()) {
         AddTested(wish, found.rgRequests, szLog, reply);
@@ -241,6 +268,10 @@ Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& sz
             "shows what came of it";
         return reply;
     }
+    if (const Reply outcome = published ? OutcomeOf(*published, found.plan.after, published->szGateway) : Reply();
+        outcome.enExit != kOk) {
+        return outcome;
+    }
     reply.enExit = !blAll ? kRefused : reply.enExit;
     reply.szMessage = !blAll                     ? "some ports that were asked for stay out; the others are in force"
                       : found.rgRequests.empty() ? "the router keeps no port for this service"
@@ -250,16 +281,60 @@ Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& sz
     return reply;
 }
 
+// A service that has no rules, or one that is written otherwise.
+std::optional<Reply> NothingToClear(const Wish& wish, const Surroundings& found) {
+    std::vector<std::string> rgszServices;
+    for (const __tag_TAVO_ROUTER_RULE& rule : found.rgStored) {
+        const std::string szName = rule.szServiceName;
+        if (szName == wish.szService || !wish.rgszPorts.empty()) {
+            return std::nullopt;
+        }
+        if (!szName.empty() && std::find(rgszServices.begin(), rgszServices.end(), szName) == rgszServices.end()) {
+            rgszServices.push_back(szName);
+        }
+    }
+    if (!wish.rgszPorts.empty()) {
+        return std::nullopt;
+    }
+    const std::string szNearest = Nearest(wish.szService, rgszServices);
+    for (std::string& szName : rgszServices) {
+        szName = Clean(szName);
+    }
+    return Reply{
+        .enExit = kUsage,
+        .szMessage = fmt::format(
+            "'{}' has no rules, and nothing was changed; {}{}", Clean(wish.szService),
+            rgszServices.empty() ? "no rule belongs to a service" : "the names of rules are " + Join(rgszServices),
+            szNearest.empty() ? "" : fmt::format("; did you mean '{}'?", Clean(szNearest)))};
+}
+
+// Why a request is not made; nothing when it may be.
+std::optional<Reply> Objections(const Wish& wish, const Surroundings& found) {
+    if (const auto reply = NothingToClear(wish, found)) {
+        return reply;
+    }
+    if (IsOff()) {
+        return Reply{.enExit = kFailed,
+                     .szMessage = "every port is switched off, and nothing was changed; 'tavoportmap on' comes first"};
+    }
+    if (found.plan.blCut) {
+        return Reply{.enExit = kUsage, .szMessage = kCut};
+    }
+    if (const std::string szFault = Objection(wish, found); !szFault.empty() && !wish.blForce) {
+        return Reply{.enExit = kUsage, .szMessage = szFault};
+    }
+    return found.blTooMany
+               ? std::optional(Reply{.enExit = kTooMany, .szMessage = "nothing was changed: " + found.plan.szRefusal})
+               : std::nullopt;
+}
+
 Reply Set(const Wish& wish, bool blJson) {
     Surroundings found;
     if (const Reply reply = LookAround(wish, found); reply.enExit != kOk) {
         return reply;
     }
-    if (const std::string szFault = Objection(wish, found); !szFault.empty() && !wish.blForce) {
-        return {.enExit = kUsage, .szMessage = szFault};
-    }
-    if (found.blTooMany) {
-        return {.enExit = kTooMany, .szMessage = "nothing was changed: " + found.plan.szRefusal};
+    if (const auto reply = Objections(wish, found)) {
+        return *reply;
     }
     KeysGuard keys(KeysGuard::Lock::kTakenByTheCall);
     if (keys.Obstacle()) {
@@ -267,6 +342,7 @@ Reply Set(const Wish& wish, bool blJson) {
     }
     Progress progress(blJson);
     progress.Show(0, "merging the request with the rules and writing them to the router");
+    const time_t nStart = std::time(nullptr);
     LogCapture log;
     const int nResult =
         TLibTavoPortMapRulesSet(wish.szService.c_str(), found.rgRequests.empty() ? nullptr : found.rgRequests.data(),
@@ -276,10 +352,10 @@ Reply Set(const Wish& wish, bool blJson) {
     if (nResult == 0) {
         keys.Keep();
     }
-    Reply reply = nResult == 0   ? SetDone(wish, found, szLog)
+    Reply reply = nResult == 0   ? SetDone(wish, found, szLog, nStart)
                   : nResult == 1 ? Failure(kNotDetected)
                   : nResult == 2 ? Busy()
-                                 : NotSet(found, szLog);
+                                 : NotSet(found, szLog, nStart);
     reply.jsAnswer["result"] = nResult;
     return reply;
 }
@@ -312,6 +388,9 @@ Reply List() {
 }
 
 Reply Detect(bool blJson) {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     if (!Gateway()) {
         return NoGateway();
     }
@@ -360,7 +439,7 @@ CLI::App* OfferRequest(CLI::App& service, Request& request, const std::string& s
         pVerb->add_flag("--test", pWish->blTest, "then test every port asked for from outside");
     }
     if (szVerb != "plan") {
-        pVerb->add_flag("--force", pWish->blForce, "also when a rule of this name is no service's, or ports get lost");
+        pVerb->add_flag("--force", pWish->blForce, "also when a rule of this name is no service's");
     }
     pVerb->callback([pWish, pfnRun, &request] {
         request.fnCommand = [pWish, pfnRun, &request] { return pfnRun(*pWish, request.blJson); };

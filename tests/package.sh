@@ -68,7 +68,7 @@ alive upnpd && [ "$(pid upnpd)" != "$nOld" ] || fail "the old daemon was left ru
 dpkg -r libtavoportmap-dev tavoportmap >/dev/null
 absent /run/upnpd.pid /usr/bin/tavoportmap
 ! pgrep -x 'upnpd|tavowatch' >/dev/null || fail "a process was left running"
-[ -e /etc/portforward/rule.conf ] || fail "removing took the rules away"
+[ -e /etc/portforward/rule.conf.draft ] || fail "removing took the rules away"
 install ./tavoportmap
 alive upnpd || fail "what was switched on does not run again"
 kill -9 "$(pid upnpd)" # its parent is about to start it again
