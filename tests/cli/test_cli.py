@@ -3,6 +3,7 @@
 Runs inside tests/sandbox, with a gateway that answers nobody. What only a router could answer comes from
 stand_in.cpp, preloaded.
 """
+import contextlib
 import fcntl
 import json
 import os
@@ -11,6 +12,7 @@ import random
 import re
 import shutil
 import signal
+import socket
 import subprocess
 import unittest
 
@@ -754,6 +756,52 @@ class Tool(unittest.TestCase):
             got, out, err = tool("service", "detect", **world)
             self.assertEqual((got, len(re.findall(pattern, out + err))), (code, 1), (detected, tested, out, err))
             self.assertEqual(os.path.exists(f"{CONF}/router_upnp.db.user"), bool(tested))
+
+    def test_what_listens_on_this_box(self):
+        """Real sockets, a program of another name, and a port that the packet filter hands to a container."""
+        with contextlib.ExitStack() as keep:
+            def bound(family, kind, address, port, peer=None):
+                made = keep.enter_context(socket.socket(family, kind))
+                made.bind((address, port))
+                if peer:
+                    made.connect(peer)
+                elif kind == socket.SOCK_STREAM:
+                    made.listen()
+            for family, kind, address, port, peer in (
+                    (socket.AF_INET, socket.SOCK_STREAM, "0.0.0.0", 7001, None),
+                    (socket.AF_INET, socket.SOCK_STREAM, "127.0.0.1", 7002, None),
+                    (socket.AF_INET6, socket.SOCK_STREAM, "::", 7003, None),
+                    (socket.AF_INET6, socket.SOCK_STREAM, "::1", 7004, None),
+                    (socket.AF_INET6, socket.SOCK_STREAM, "::ffff:127.0.0.1", 7005, None),
+                    (socket.AF_INET, socket.SOCK_STREAM, "192.168.77.2", 7006, None),
+                    (socket.AF_INET, socket.SOCK_DGRAM, "0.0.0.0", 7007, None),
+                    (socket.AF_INET, socket.SOCK_DGRAM, "127.0.0.1", 7008, ("127.0.0.1", 9)),
+                    (socket.AF_INET, socket.SOCK_STREAM, "127.0.0.1", 7009, ("127.0.0.1", 7002))):
+                bound(family, kind, address, port, peer)
+            carrier = "import socket; s=socket.create_server(('0.0.0.0', 7010)); print(1, flush=True); input()"
+            put("/proc/self/comm", "tester")
+            put("/tmp/run.py", f"open('/proc/self/comm', 'w').write('docker-proxy')\n{carrier}\n")
+            other = keep.enter_context(subprocess.Popen(["/usr/bin/python3", "/tmp/run.py"], stdin=subprocess.PIPE,
+                                                        stdout=subprocess.PIPE, text=True))
+            other.stdout.readline()
+            for step in ("link add inner type veth peer name inner1", "addr add 172.29.0.1/24 dev inner",
+                         "link set inner up", "link set inner1 up"):
+                subprocess.run(["ip", *step.split()], check=True)
+            subprocess.run(["nft", "-f", "-"], check=True, text=True, input="""table ip containers { chain in {
+                type nat hook prerouting priority dstnat
+                tcp dport { 7011, 7012-7013 } dnat to 172.29.0.2:80
+                udp dport 7014 counter dnat to 172.29.0.2
+                tcp dport != 7015 dnat to 172.29.0.2
+                tcp dport 7016 dnat to 192.168.77.9
+                tcp dport 7017 accept } }""")
+            told = subprocess.run([f"{BUILD}/tests/cli/listeners"], capture_output=True, text=True, check=True).stdout
+            other.stdin.close()
+        self.assertEqual(told.splitlines(), [
+            "tcp 7001 0.0.0.0 open tester", "tcp 7002 127.0.0.1 loopback tester", "tcp 7003 :: open tester",
+            "tcp 7004 ::1 loopback tester", "tcp 7005 ::ffff:127.0.0.1 loopback tester",
+            "tcp 7006 192.168.77.2 open tester", "tcp 7010 0.0.0.0 open docker-proxy(container)",
+            *(f"tcp {port} 0.0.0.0 open (container)" for port in (7011, 7012, 7013)),
+            "udp 7007 0.0.0.0 open tester", "udp 7014 0.0.0.0 open (container)"])
 
     def test_models(self):
         os.makedirs(MODELS)

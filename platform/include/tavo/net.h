@@ -47,6 +47,32 @@ int checkDefaultGatewaySetting(char* szGateway, int nSize);
 int checkConnectToWAN(void);
 /* A name (platform.conf, [network]) can be resolved through the box's name servers. 6 seconds at most. */
 int checkDNSSetting(void);
+
+/* ---- what the default gateway says itself ---------------------------------------------------------- */
+
+enum TAVO_NET_ADDRESS_KIND {
+    TAVO_NET_ADDRESS_UNKNOWN = 0, /* none given, or one that says nothing about a place in the network */
+    TAVO_NET_ADDRESS_PUBLIC,
+    TAVO_NET_ADDRESS_PRIVATE, /* another router stands in front: 10/8, 172.16/12, 192.168/16 */
+    TAVO_NET_ADDRESS_CARRIER  /* the provider translates, too: 100.64/10 */
+};
+
+/* What became of the question for the outside address that NAT-PMP has; other values are the protocol's own
+ * result codes (2: refused, mostly because it is switched off; 3: no connection outside now). */
+enum { TAVO_NET_NATPMP_SILENT = -1, TAVO_NET_NATPMP_OK = 0, TAVO_NET_NATPMP_REFUSED = 2, TAVO_NET_NATPMP_OFFLINE = 3 };
+
+typedef struct tag_TAVO_NET_GATEWAY_WORD {
+    char szGateway[16];
+    int nThere;         /* 0: nobody on the home network answers to its address; 1: it is there, or it cannot be told */
+    int nNatpmp;        /* TAVO_NET_NATPMP_... */
+    char szOutside[16]; /* its address on the other side by its own word: by NAT-PMP, else by UPnP; empty: no word */
+    enum TAVO_NET_ADDRESS_KIND enOutside;
+} TAVO_NET_GATEWAY_WORD;
+
+/* Asks the default gateway. 0: *pWord filled; -1: no gateway, or null, *pWord untouched. 8 seconds at most, when it
+ * does everything late; a well-behaved one takes less than one. */
+int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord);
+
 #ifdef __cplusplus
 }
 

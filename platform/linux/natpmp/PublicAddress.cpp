@@ -20,27 +20,34 @@ constexpr unsigned char kAnswerKind = 128;
 constexpr size_t kAnswerSize = 12;
 constexpr size_t kAddressAt = 8;
 
-std::optional<in_addr> ReadAnswer(int fd) {
+constexpr size_t kCodeAt = 2;
+
+NatPmpWord ReadAnswer(int fd) {
     unsigned char rgAnswer[kAnswerSize];
-    in_addr address = {};
-    if (recv(fd, rgAnswer, sizeof(rgAnswer), 0) != static_cast<ssize_t>(kAnswerSize) || rgAnswer[0] != 0 ||
-        rgAnswer[1] != kAnswerKind || rgAnswer[2] != 0 || rgAnswer[3] != 0) {
-        return std::nullopt;
+    const ssize_t nSize = recv(fd, rgAnswer, sizeof(rgAnswer), 0);
+    // A refusal may leave the address out.
+    if (nSize < static_cast<ssize_t>(kAddressAt) || rgAnswer[0] != 0 || rgAnswer[1] != kAnswerKind) {
+        return {};
     }
-    std::memcpy(&address, rgAnswer + kAddressAt, sizeof(address));
-    return address.s_addr == 0 ? std::nullopt : std::optional<in_addr>(address);
+    NatPmpWord word{.nCode = rgAnswer[kCodeAt] << 8U | rgAnswer[kCodeAt + 1]};
+    in_addr address = {};
+    if (word.nCode == 0 && nSize == static_cast<ssize_t>(kAnswerSize)) {
+        std::memcpy(&address, rgAnswer + kAddressAt, sizeof(address));
+        word.address = address.s_addr == 0 ? std::nullopt : std::optional<in_addr>(address);
+    }
+    return word;
 }
 
 }  // namespace
 
-std::optional<in_addr> NatPmpPublicAddress(const in_addr& gateway) {
+NatPmpWord AskNatPmp(const in_addr& gateway) {
     const Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     sockaddr_in to = {};
     to.sin_family = AF_INET;
     to.sin_addr = gateway;
     to.sin_port = htons(kPort);
     if (fd.Get() < 0 || connect(fd.Get(), reinterpret_cast<const sockaddr*>(&to), sizeof(to)) != 0) {
-        return std::nullopt;
+        return {};
     }
     for (const int nMilliseconds : kWaitMilliseconds) {
         pollfd waiting = {fd.Get(), POLLIN, 0};
@@ -49,7 +56,7 @@ std::optional<in_addr> NatPmpPublicAddress(const in_addr& gateway) {
             return ReadAnswer(fd.Get());  // also when it said that nobody listens there
         }
     }
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace tavo

@@ -8,7 +8,10 @@
 
 namespace tavo {
 
-// Nothing when the gateway does not speak NAT-PMP, refuses, or has no outside address now.
-std::optional<in_addr> NatPmpPublicAddress(const in_addr& gateway);
+struct NatPmpWord {
+    std::optional<int> nCode;        // the protocol's result code; nothing when the gateway does not speak NAT-PMP
+    std::optional<in_addr> address;  // nothing when it refuses, or has no outside address now
+};
+NatPmpWord AskNatPmp(const in_addr& gateway);
 
 }  // namespace tavo

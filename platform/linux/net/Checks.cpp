@@ -14,6 +14,7 @@
 #include "core/Descriptor.h"
 #include "natpmp/PublicAddress.h"
 #include "net/Level.h"
+#include "net/Neighbour.h"
 #include "net/Outside.h"
 #include "net/Walk.h"
 #include "tavo/net.h"
@@ -95,10 +96,7 @@ in_addr AddressOf(const std::string& szText) {
     return address;
 }
 
-std::optional<in_addr> ExternalAddress(const std::string& szGateway) {
-    if (const auto address = tavo::NatPmpPublicAddress(AddressOf(szGateway))) {
-        return address;
-    }
+std::optional<in_addr> AskUpnp() {
     const auto pIgd = tavo::FindGatewayIgd(kUpnpMilliseconds, 0);
     std::string szAddress;
     if (pIgd != nullptr) {
@@ -109,6 +107,24 @@ std::optional<in_addr> ExternalAddress(const std::string& szGateway) {
     }
     const in_addr address = AddressOf(szAddress);
     return address.s_addr == 0 ? std::nullopt : std::optional<in_addr>(address);
+}
+
+std::optional<in_addr> ExternalAddress(const std::string& szGateway) {
+    const auto address = tavo::AskNatPmp(AddressOf(szGateway)).address;
+    return address ? address : AskUpnp();
+}
+
+TAVO_NET_ADDRESS_KIND SeamKind(tavo::AddressKind enKind) {
+    switch (enKind) {
+        case tavo::AddressKind::kPublic:
+            return TAVO_NET_ADDRESS_PUBLIC;
+        case tavo::AddressKind::kPrivate:
+            return TAVO_NET_ADDRESS_PRIVATE;
+        case tavo::AddressKind::kCarrier:
+            return TAVO_NET_ADDRESS_CARRIER;
+        default:
+            return TAVO_NET_ADDRESS_UNKNOWN;
+    }
 }
 
 // A packet for the address that may make one hop only: when somebody else says that its life ended there,
@@ -200,6 +216,27 @@ int getPublicIPLevel(int& nLevel, int nHops) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
         }
         nLevel = *level;
+        return 0;
+    });
+}
+
+int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
+    return AtBorder(-1, [&] {
+        const std::string szGateway = Gateway();
+        if (pWord == nullptr || szGateway.empty()) {
+            return Fail(pWord == nullptr ? TLIBC_ERR_BAD_PARAMETER : TLIBC_ERR_NOT_FOUND, __LINE__);
+        }
+        const tavo::NatPmpWord natpmp = tavo::AskNatPmp(AddressOf(szGateway));
+        const auto outside = natpmp.address ? natpmp.address : AskUpnp();
+        *pWord = {};
+        std::snprintf(pWord->szGateway, sizeof(pWord->szGateway), "%s", szGateway.c_str());
+        // Whoever has answered is there.
+        pWord->nThere = natpmp.nCode || outside || tavo::IsNeighbourThere(szGateway, [] { return false; }) ? 1 : 0;
+        pWord->nNatpmp = natpmp.nCode.value_or(TAVO_NET_NATPMP_SILENT);
+        if (outside) {
+            inet_ntop(AF_INET, &*outside, pWord->szOutside, sizeof(pWord->szOutside));
+            pWord->enOutside = SeamKind(tavo::KindOf(*outside));
+        }
         return 0;
     });
 }
