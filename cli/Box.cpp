@@ -15,8 +15,8 @@ std::optional<std::string> Gateway() {
 Reply NoGateway() {
     return {.enExit = kFailed,
             .szMessage =
-                "this box has no default gateway, so there is no router to talk to; 'ip route' shows the "
-                "routes"};
+                "this box has no default gateway, so there is no router to talk to: plug the cable in or see to the "
+                "network settings ('ip route' shows the routes), then run 'tavoportmap setup'"};
 }
 
 std::optional<Reply> NeedsRoot() {
@@ -68,12 +68,14 @@ std::string RouterName(const std::string& szBrand, const std::string& szModel, c
 std::optional<std::string> OtherLimit(const std::string& szBrand, const std::string& szModel,
                                       const std::string& szVersion, int nMaxRules) {
     int nKnown = -1;
-    if (RouterUpnpDB(szBrand, szModel, szVersion).GetMaxRule(nKnown) && nKnown == nMaxRules) {
-        return std::nullopt;
+    if (!RouterUpnpDB(szBrand, szModel, szVersion).GetMaxRule(nKnown) || nKnown < 0) {
+        return "the number of rules that it holds could not be read back; the system log says why";
     }
-    return fmt::format(
-        "the downloaded database says that this router holds {} rules; its word comes before what is recorded here",
-        nKnown);
+    return nKnown == nMaxRules
+               ? std::nullopt
+               : std::optional(fmt::format("the downloaded database says that this router holds {}; its word comes "
+                                           "before what is recorded here",
+                                           nKnown == 0 ? "any number of rules" : fmt::format("{} rules", nKnown)));
 }
 
 std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, int nMaxRules) {

@@ -1,108 +1,59 @@
-// "compat": whether the router's UPnP can be relied on, and how many rules it really keeps. Relies on the
-// library's compatibility test. Promises: a test that runs already is never disturbed; a stopped one leaves no
-// mapping and no record; nothing is recorded that nobody agreed to.
+// "compat": whether the router's UPnP can be relied on, and how many rules it really keeps. Relies on CompatRun.
+// Promises: a test that runs already is never disturbed; a stopped one leaves no mapping and no record; nothing is
+// recorded that nobody agreed to.
 #include <fmt/format.h>
-#include <unistd.h>
 
-#include <iostream>
-#include <mutex>
-
+#include "Ask.h"
 #include "Box.h"
 #include "Commands.h"
+#include "CompatRun.h"
 #include "CompatTest.h"
-#include "Progress.h"
 #include "Usage.h"
 
 namespace tavo::cli {
 
 namespace {
 
-using TestResult = __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
-
 constexpr int kLeastRules = 3;
 constexpr int kMostRules = 1000;
-constexpr int kUsualRules = 60;
 
 struct Wish {
-    int nRules = kUsualRules;
+    int nRules = kUsualTestRules;
     bool blRecord = false;
     bool blYes = false;
     bool blStop = false;
 };
 
-// In the order in which they come; the percentages go back once, the bar does not.
-constexpr Step kSteps[] = {
-    {10, "preparing", "the test could not begin; the system log says why", "prepare"},
-    {20, "looking for the router", "the router could not be asked; the system log says why", "find"},
-    {30, "making test mappings on the router",
-     "it did not take the test mappings (or the test daemon of this box did not start; the system log says which)",
-     "add"},
-    {60, "counting the mappings that the router really holds",
-     "it holds none of the mappings that it said yes to, or does not show what it holds", "count"},
-    {40, "taking the mappings away", "it did not take the mappings away when it was told to", "delete"},
-    {50, "looking whether the ports are closed again", "ports of deleted mappings are still open", "closed"},
-    {70, "making the mappings again, and changing them", "it did not take mappings a second time", "add again"},
-    {80, "looking whether the ports are open", "ports of its mappings stay closed", "open"},
-    {90, "taking everything away", "the last mappings could not be taken away", "end"},
-    {100, "done", "", "done"},
-};
-
-struct Watch {
-    Progress progress;
-    std::mutex mutex = {};  // held for good by whoever stops the test
-    int nLast = 0;          // the step that was begun last
-};
-
-void ShowStep(const TestResult* pResult, void* pData) {
-    auto* pWatch = static_cast<Watch*>(pData);
-    const std::lock_guard guard(pWatch->mutex);
-    pWatch->nLast = pResult->nProgress < 100 ? pResult->nProgress : pWatch->nLast;
-    pWatch->progress.Show(pResult->nProgress, StepAt(kSteps, pResult->nProgress).szDoing);
-}
-
 // ---- the record -----------------------------------------------------------------------------------------
 
-bool Confirm(const std::string& szQuestion) {
-    std::cerr << szQuestion << " [y/N] " << std::flush;
-    std::string szAnswer;
-    return std::getline(std::cin, szAnswer) && !szAnswer.empty() && (szAnswer[0] == 'y' || szAnswer[0] == 'Y');
-}
-
-// What recording the outcome would change.
-std::string Effect(const TestResult& result, bool blPassed) {
-    return blPassed ? fmt::format(
-                          "detection takes this model's UPnP as working, and a save of more than {} rules is refused "
-                          "before anything is changed",
-                          result.nMaxRule)
-                    : "detection takes this model's UPnP as unknown, and no save checks how many rules it holds";
-}
-
-bool IsWanted(const TestResult& result, bool blPassed, const Wish& wish, bool blJson) {
-    if (wish.blYes || (wish.blRecord && blPassed)) {
+// A question needs the result before it; whoever is asked sees it, and is not told again.
+bool IsWanted(const TestRun& run, const Wish& wish, bool blJson, Reply& reply) {
+    if (wish.blYes || (wish.blRecord && run.HasPassed())) {
         return true;
     }
+    if (blJson || !IsAnybodyThere()) {
+        return false;
+    }
+    Print(reply, false);
+    reply.szBody.clear();
+    reply.szMessage.clear();
+    reply.rgszWarnings.clear();
     // The file holds one record: a failure takes the place of a limit that was found before.
-    return !blJson && isatty(STDIN_FILENO) != 0 &&
-           Confirm(fmt::format("Recorded, this changes: {}.\nIt takes the place of the last record. Record it?",
-                               Effect(result, blPassed)));
+    return Confirm(fmt::format("Recorded, this changes: {}.\nIt takes the place of the last record. Record it?",
+                               RecordEffect(run)));
 }
 
-void Record(const TestResult& result, bool blPassed, Reply& reply) {
-    __tag_TAVO_ROUTER_RECORD record = {};
-    Put(record.szBrand, result.szBrand);
-    Put(record.szModel, result.szModel);
-    Put(record.szVersion, result.szVersion);
-    Put(record.szSupport, result.szSupport);
-    record.nMaxRule = result.nMaxRule;
-    if (TLibWriteRecordIntoUpnpDB(&record) != 0) {
-        reply.rgszWarnings.push_back(
-            Failure("the outcome could not be recorded in /etc/portforward/router_upnp.db.user").szMessage);
+void Record(const TestRun& run, Reply& reply) {
+    if (const std::string szFault = RecordTest(run); !szFault.empty()) {
+        reply.rgszWarnings.push_back(szFault);
         reply.enExit = kFailed;
         return;
     }
     reply.jsAnswer["recorded"] = true;
-    reply.szMessage += fmt::format("\nrecorded: {}", Effect(result, blPassed));
-    if (const auto szFault = OtherLimit(result.szBrand, result.szModel, result.szVersion, result.nMaxRule)) {
+    reply.szMessage += fmt::format("{}recorded: {}", reply.szMessage.empty() ? "" : "\n", RecordEffect(run));
+    const TestResult& result = run.result;
+    if (const auto szFault = OtherLimit(result.szBrand, result.szModel, result.szVersion, result.nMaxRule);
+        szFault && run.HasPassed()) {
         reply.rgszWarnings.push_back(*szFault);
     }
 }
@@ -122,53 +73,38 @@ Json::Value ToJson(const TestResult& result) {
     return js;
 }
 
-// A test that could not run.
-Reply NotRun(const TestResult& result, int nLast) {
-    switch (result.nStatus) {
-        case 2:
-            return Busy();
-        case 13:
-            return Failure(
-                "no router answered that speaks UPnP and says what it is; nothing was changed. Switch UPnP on in the "
-                "router's settings; 'tavoportmap detect' looks at the rest of the way");
-        default:
-            return Failure(StepAt(kSteps, nLast).szFailed);
-    }
-}
-
-Reply Outcome(const TestResult& result, bool blPassed, int nLast, int nAsked) {
+Reply Outcome(const TestRun& run, int nAsked) {
+    const TestResult& result = run.result;
+    const bool blPassed = run.HasPassed();
     Reply reply{.enExit = blPassed ? kOk : kFailed};
-    const Step& failed = StepAt(kSteps, nLast);
     const std::string szName = RouterName(result.szBrand, result.szModel, result.szVersion);
     reply.szBody = Columns({{"router", szName.empty() ? "without a name" : szName},
                             {"UPnP", blPassed ? "works: every step passed" : "cannot be relied on"},
-                            {"failed", blPassed ? "" : failed.szFailed},
+                            {"failed", blPassed ? "" : run.FailedWords()},
                             {"holds", blPassed && result.nMaxRule > 0 ? LimitWords(result.nMaxRule, nAsked) : ""}});
     reply.szMessage = blPassed ? "the router passed the test"
-                               : fmt::format(
-                                     "the router failed the test: {}\nMore of it stands in "
-                                     "/var/log/router.log; 'tavoportmap report' sends it to the report server",
-                                     failed.szFailed);
-    reply.jsAnswer["failed_step"] = blPassed ? Json::Value() : Json::Value(failed.szName);
+                               : fmt::format("the router failed the test: {}\n{}", run.FailedWords(), AfterFailure());
+    reply.jsAnswer["failed_step"] = blPassed ? Json::Value() : Json::Value(run.FailedName());
     return reply;
 }
 
-Reply Conclude(const TestResult& result, int nResult, int nLast, const Wish& wish, bool blJson) {
-    Reply reply = nResult < 0 ? NotRun(result, nLast) : Outcome(result, nResult == 0, nLast, wish.nRules);
-    reply.jsAnswer["passed"] = nResult < 0 ? Json::Value() : Json::Value(nResult == 0);
+Reply Conclude(const TestRun& run, const Wish& wish, bool blJson) {
+    const TestResult& result = run.result;
+    Reply reply = run.nResult < 0 ? NotRun(run) : Outcome(run, wish.nRules);
+    reply.jsAnswer["passed"] = run.nResult < 0 ? Json::Value() : Json::Value(run.HasPassed());
     reply.jsAnswer["status"] = result.nStatus;
     reply.jsAnswer["recorded"] = false;
     reply.jsAnswer["router"] = ToJson(result);
     reply.jsAnswer["max_rules"] = result.nMaxRule > 0 ? Json::Value(result.nMaxRule) : Json::Value();
-    if (nResult < 0) {
+    if (run.nResult < 0) {
         return reply;
     }
     if (*result.szSupport == '\0') {
         reply.rgszWarnings.emplace_back("the router does not say what it is, so that nothing can be recorded of it");
-    } else if (IsWanted(result, nResult == 0, wish, blJson)) {
-        Record(result, nResult == 0, reply);
+    } else if (IsWanted(run, wish, blJson, reply)) {
+        Record(run, reply);
     } else {
-        reply.szMessage += "\nnot recorded";
+        reply.szMessage += reply.szMessage.empty() ? "not recorded" : "\nnot recorded";
     }
     return reply;
 }
@@ -185,21 +121,13 @@ Reply Test(const Wish& wish, bool blJson) {
     if (!lock.IsHeld()) {
         return Busy();
     }
-    TestResult result = {};
-    Watch watch{Progress(blJson)};
-    int nResult = -1;
-    {
-        const StopOnSignal stop(blJson, [&watch] {
-            watch.mutex.lock();
-            watch.progress.End();
-        });
-        nResult = TLibTestUpnpCompatibility(wish.nRules, &result, &ShowStep, &watch, false);
-    }
-    watch.progress.End();
-    return Conclude(result, nResult, watch.nLast, wish, blJson);
+    return Conclude(RunTest(wish.nRules, blJson), wish, blJson);
 }
 
 Reply Compat(const Wish& wish, bool blJson) {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     if (!wish.blStop) {
         return Test(wish, blJson);
     }
@@ -221,7 +149,8 @@ Reply Compat(const Wish& wish, bool blJson) {
 void OfferCompat(CLI::App& app, Request& request) {
     const auto pWish = std::make_shared<Wish>();
     CLI::App* pCompat = AddCommand(app, "compat", "test whether the router's UPnP can be relied on; takes minutes");
-    pCompat->add_option("--rules", pWish->nRules, fmt::format("how many mappings to try (default: {})", kUsualRules))
+    pCompat
+        ->add_option("--rules", pWish->nRules, fmt::format("how many mappings to try (default: {})", kUsualTestRules))
         ->check(NumberBetween(kLeastRules, kMostRules))
         ->type_name("NUMBER");
     pCompat->add_flag("--record", pWish->blRecord, "record a test that passed, without asking");

@@ -54,13 +54,12 @@ std::string WhyNotMade() {
     DetectResult detected = {};
     TLibGetRouterDetectResult(&detected);
     if (*detected.szBrand == '\0' && *detected.szModel == '\0') {
-        return "a report says which router it is about, and none has been found yet: 'tavoportmap detect' comes first";
+        return "a report says which router it is about, and none has been found yet: 'tavoportmap detect' looks for it";
     }
-    const Way enWay = WayOf(detected);
-    if (enWay != Way::kUpnp && enWay != Way::kNatpmp) {
+    if (!CanBeReported()) {
         return fmt::format(
-            "a report carries the settings of the detected router, and those of one that no database knows to work "
-            "with UPnP or NAT-PMP cannot be written without an account of its pages. The files of the test are {}",
+            "a report is about a router that a database or a test knows to work with UPnP or NAT-PMP, which this one "
+            "is not. The files of its last test are {}",
             fmt::join(kTestFiles, ", "));
     }
     return "its files could not be packed; the system log says why";
@@ -82,6 +81,9 @@ bool IsLocked() {
 }
 
 Reply Report() {
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     if (!Gateway()) {
         return NoGateway();
     }
@@ -108,7 +110,8 @@ void OfferReport(CLI::App& app, Request& request) {
     pReport->footer(
         "Packs what the last 'compat' left, with the brand, model and version of the router, and sends\n"
         "it to the report server (server in [report] of /etc/tavo/platform.conf). Your settings and\n"
-        "passwords are not in it. It needs a detected router that is known for UPnP or NAT-PMP.\n");
+        "passwords are not in it. It can be made of a router that a database or a test knows to work\n"
+        "with UPnP or NAT-PMP; of another one the files are named.\n");
     pReport->callback([&request] { request.fnCommand = &Report; });
 }
 

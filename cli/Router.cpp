@@ -3,6 +3,7 @@
 // command line; settings that could not be read are neither shown as empty nor overwritten.
 #include <fmt/format.h>
 
+#include "Account.h"
 #include "Box.h"
 #include "Commands.h"
 #include "Secret.h"
@@ -62,15 +63,17 @@ Reply Show(bool blShowPassword) {
     reply.jsAnswer["gateway"] = settings.szGateway;
     reply.jsAnswer["router"] = Json::Value();
     if (settings.enFound == Found::kNothing) {
+        const std::string szOther = OtherGateway(settings.szGateway);
+        reply.jsAnswer["other_gateway"] = szOther.empty() ? Json::Value() : Json::Value(szOther);
         reply.szMessage =
-            fmt::format("nothing is stored for the router {} yet; 'tavoportmap detect --save' finds out what it is",
-                        settings.szGateway);
+            fmt::format("nothing is stored for the router {} yet{}; 'tavoportmap setup' finds out what it is",
+                        settings.szGateway, szOther.empty() ? "" : ", only for another one (" + Clean(szOther) + ")");
         return reply;
     }
     if (settings.enFound == Found::kWithoutLimit) {
         reply.rgszWarnings.emplace_back(
             "nobody has recorded how many rules this router holds, so no rules can be saved; 'tavoportmap router "
-            "set --max-rules NUMBER' records it (0: no limit is known)");
+            "set --max-rules 0' records that no limit is known, another number how many there are");
     }
     reply.jsAnswer["router"] = ToJson(settings.conf, blShowPassword);
     reply.szBody = ToText(settings.szGateway, settings.conf, blShowPassword);
@@ -117,11 +120,18 @@ Reply ReadPassword(const Wish& wish, RouterConf& conf) {
     return Put(conf.szPass, *szPassword) ? Reply{} : Reply{.enExit = kUsage, .szMessage = "the password is too long"};
 }
 
+bool IsDaemonRouter(const RouterConf& conf) {
+    const Way enWay = WayOf(conf.szSupportUpnp, conf.szSupportNatpmp);
+    return enWay == Way::kUpnp || enWay == Way::kNatpmp;
+}
+
 // What the wish leaves open; empty when nothing.
 std::string FaultOf(const RouterConf& conf) {
-    const Way enWay = WayOf(conf.szSupportUpnp, conf.szSupportNatpmp);
+    if (*conf.szBrand == '\0' && *conf.szModel == '\0' && *conf.szVersion == '\0') {
+        return "what is the router? Say at least one of --brand, --model and --version, under which it is remembered";
+    }
     const bool blReachable = *conf.szConnType != '\0' && *conf.szConnPort != '\0';
-    return enWay == Way::kUpnp || enWay == Way::kNatpmp || blReachable
+    return IsDaemonRouter(conf) || blReachable
                ? ""
                : "a router without UPnP and NAT-PMP is driven through its own pages, which needs --conn-type and "
                  "--conn-port (for example --conn-type http --conn-port 80); if it has one of the two, say --upnp "
@@ -151,6 +161,9 @@ Reply Set(const Wish& wish) {
         !Overlay(conf.szSupportNatpmp, wish.szNatpmp) || !Overlay(conf.szUser, wish.szUser) ||
         !Overlay(conf.szConnType, wish.szConnType) || !Overlay(conf.szConnPort, wish.szConnPort)) {
         return {.enExit = kUsage, .szMessage = fmt::format("a value is too long; {} bytes fit", TAVO_TEXT_SIZE - 1)};
+    }
+    if (!IsDaemonRouter(conf)) {
+        BringAccount(settings.szGateway, conf);
     }
     if (const std::string szFault = FaultOf(conf); !szFault.empty()) {
         return {.enExit = kUsage, .szMessage = szFault};
@@ -186,7 +199,8 @@ void OfferSet(CLI::App& router, Request& request) {
         ->type_name("NUMBER");
     pSet->footer(
         "A router that is driven by UPnP or NAT-PMP needs no account and no connection; a router\n"
-        "that has neither needs both, and a description ('tavoportmap routers').\n"
+        "that has neither needs both, and a description ('tavoportmap routers'). The account is kept\n"
+        "for the day when UPnP or NAT-PMP is switched off again.\n"
         "Examples:\n"
         "  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes --max-rules 32\n"
         "  tavoportmap router set --user admin --conn-type http --conn-port 80\n");

@@ -3,6 +3,7 @@
 
 #include <fmt/format.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 
@@ -19,20 +20,12 @@ constexpr char kManualRouter[] =
     "this router is driven through its own pages, where a service's ports are never written; 'tavoportmap rules add' "
     "and 'save' forward them";
 
-// Whether there are settings that nobody can read; the library deletes such a file when it is asked.
-bool IsUnreadable(const std::string& szGateway) {
-    std::error_code error;
-    bool blExist = false;
-    return std::filesystem::file_size(kConfFile, error) > 0 && !error &&
-           RouterConfReader(szGateway).IsSectionExist(blExist) == 0;
-}
-
-Found Look(const std::string& szGateway, RouterConf& conf) {
-    if (IsUnreadable(szGateway)) {
+Found Look(const std::string& szGateway, RouterConf& conf, bool blLock) {
+    if (AreUnreadable(szGateway)) {
         return Found::kFailed;
     }
     auto enError = TAVO_LIBTAVOPORTMAP_ERR_NONE;
-    const int nResult = TLibGetRouterConf(szGateway.c_str(), &conf, &enError, true);
+    const int nResult = TLibGetRouterConf(szGateway.c_str(), &conf, &enError, blLock);
     if (nResult >= 0) {
         return nResult == 0 ? Found::kYes : Found::kNothing;
     }
@@ -52,8 +45,8 @@ std::optional<Reply> Obstacle(Found enFound) {
         return std::nullopt;
     }
     return Failure(
-        fmt::format("{} cannot be read as settings; it was left as it is. 'tavoportmap detect --save' or a "
-                    "complete 'router set' after removing it starts anew",
+        fmt::format("{} cannot be read as settings; it was left as it is. 'tavoportmap setup' puts it aside and starts "
+                    "anew",
                     kConfFile));
 }
 
@@ -95,15 +88,36 @@ __TAG_TAVO_ROUTER_INIT_STATE StateOf(const Settings& settings) {
 
 const char kNotDetected[] = "the router has not been detected yet: 'tavoportmap service detect' comes first";
 
-Settings ReadSettings() {
+bool AreUnreadable(const std::string& szGateway) {
+    std::error_code error;
+    bool blExist = false;
+    return std::filesystem::file_size(kConfFile, error) > 0 && !error &&
+           RouterConfReader(szGateway).IsSectionExist(blExist) == 0;
+}
+
+bool PutAside() {
+    return std::rename(kConfFile, (std::string(kConfFile) + ".unreadable").c_str()) == 0;
+}
+
+std::string OtherGateway(const std::string& szGateway) {
+    RouterConfReader reader;
+    std::string szSection;
+    return reader.GetSectionName(szSection) != 0 && szSection != szGateway ? szSection : "";
+}
+
+Settings ReadSettings(bool blLocked) {
     Settings settings;
+    settings.obstacle = NeedsRoot();  // the settings are nobody else's to read
+    if (settings.obstacle) {
+        return settings;
+    }
     const auto szGateway = Gateway();
     if (!szGateway) {
         settings.obstacle = NoGateway();
         return settings;
     }
     settings.szGateway = *szGateway;
-    settings.enFound = Look(*szGateway, settings.conf);
+    settings.enFound = Look(*szGateway, settings.conf, !blLocked);
     settings.obstacle = Obstacle(settings.enFound);
     return settings;
 }
@@ -114,8 +128,8 @@ ServiceRouter ReadServiceRouter(const Settings& settings) {
     ServiceRouter router{.blUpnp = enFound == Found::kYes && std::string(conf.szSupportUpnp) == "yes"};
     if (enFound == Found::kWithoutLimit) {
         router.szRefusal =
-            "nobody has recorded how many rules the router holds, so no rules can be saved; 'tavoportmap compat "
-            "--record' finds it out";
+            "nobody has recorded how many rules the router holds, so no rules can be saved; 'tavoportmap setup' "
+            "finds it out";
         return router;
     }
     if (*conf.szMaxRule != '\0') {
@@ -131,7 +145,7 @@ ServiceRouter ReadServiceRouter(const Settings& settings) {
             router.szRefusal = kManualRouter;
             break;
         default:
-            router.szRefusal = "what is remembered of the router cannot be read; 'tavoportmap detect --save' anew";
+            router.szRefusal = "what is remembered of the router cannot be read; 'tavoportmap setup' does it anew";
     }
     return router;
 }

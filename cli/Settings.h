@@ -1,5 +1,6 @@
 // The stored settings of the router behind the current gateway, and what they let a service do. Relies on
-// TLibGetRouterConf, the detection cache and the compatibility database. Promises: changes nothing.
+// TLibGetRouterConf, the detection cache and the compatibility database. Promises: changes nothing unless its
+// name says so.
 #pragma once
 
 #include <optional>
@@ -20,7 +21,15 @@ struct Settings {
     Found enFound = Found::kFailed;
     std::optional<Reply> obstacle = {};  // what keeps a command from going on; nothing when nothing does
 };
-Settings ReadSettings();
+// blLocked: the caller holds the router lock.
+Settings ReadSettings(bool blLocked = false);
+
+// Whether there are settings that nobody can read; the library deletes such a file when it is asked.
+bool AreUnreadable(const std::string& szGateway);
+// Keeps it as router.conf.unreadable and makes room for new settings.
+bool PutAside();
+// The gateway that the stored settings are about when it is not this one; else empty.
+std::string OtherGateway(const std::string& szGateway);
 
 // The router as a service's request meets it.
 struct ServiceRouter {

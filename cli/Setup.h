@@ -4,7 +4,13 @@
 
 #include "Answer.h"
 
+namespace CLI {
+class App;
+}
+
 namespace tavo::cli {
+
+struct Request;
 
 struct SetupWish {
     bool blYes = false;   // asks nothing
@@ -16,5 +22,8 @@ Reply Setup(const SetupWish& wish, bool blJson);
 
 // Whether rules can be saved with what is stored for the current gateway.
 bool IsRouterKnown();
+
+// Offers the command, as in Commands.h.
+void OfferSetup(CLI::App& app, Request& request);
 
 }  // namespace tavo::cli

@@ -30,7 +30,7 @@ void AddSettings(const std::string& szGateway, Reply& reply,
     bool blExist = false;
     reply.jsAnswer["router"] = Json::Value();
     if (reader.IsSectionExist(blExist) == 0 || !blExist) {
-        rgLines.emplace_back("settings", "none yet; 'tavoportmap detect --save' finds out what the router is");
+        rgLines.emplace_back("settings", "none yet; 'tavoportmap setup' finds out what the router is");
         return;
     }
     std::string szBrand, szModel, szVersion, szUpnp, szNatpmp;

@@ -9,10 +9,10 @@ namespace {
 
 enum SaveStatus : int { kTooManyRules = 7, kTooManyPorts = 10, kNoRangePage = 11, kTooManyRanges = 12 };
 
-constexpr char kDetect[] =
-    "\n  tavoportmap detect --save                  asks the router and remembers the answer"
-    "\n  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes"
-    "\n                                             says it yourself, when detection cannot";
+constexpr char kFindOut[] =
+    "\n  tavoportmap setup                          asks the router, tests it and remembers the answer"
+    "\n  tavoportmap router set --brand BRAND --model MODEL --version VERSION --upnp yes"
+    "\n                                             says it yourself, when it cannot be found out";
 
 // Which limit of the pages is in the way, as the library reports it: by the limits alone.
 void ReportPages(RouterDB& db, int nMaxPort, int nMaxRange, SaveResult& result) {
@@ -65,11 +65,11 @@ StoredRouter ReadStoredRouter() {
 
 std::optional<std::string> WhyUnsavable(const StoredRouter& router, const std::string& szGateway) {
     if (!router.blAny) {
-        return fmt::format("nothing is known of the router {} yet:{}", szGateway, kDetect);
+        return fmt::format("nothing is known of the router {} yet:{}", szGateway, kFindOut);
     }
     if (router.szSection != szGateway) {
         return fmt::format("what is stored is about another router ({}) than {}:{}", Clean(router.szSection), szGateway,
-                           kDetect);
+                           kFindOut);
     }
     int nMaxRules = -1;
     if (router.enWay == Way::kManual) {

@@ -4,6 +4,8 @@
 
 #include <fmt/format.h>
 
+#include "Account.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -23,6 +25,14 @@ constexpr Warning kWarnings[] = {
      "  - forward the same ports on the outer router, too;\n"
      "  - where the outer router is the provider's, ask the provider for a public address of your own"},
 };
+
+constexpr char kCarrier[] =
+    "the provider translates addresses, too (carrier NAT, 100.64.0.0/10), so an open port here cannot be reached from "
+    "outside over IPv4. One of these helps:\n"
+    "  - ask the provider for a public IPv4 address of your own; many give one on request;\n"
+    "  - use IPv6, where the provider has it;\n"
+    "  - rent a small host elsewhere that passes connections on, or use a VPN that does";
+constexpr int kManyTranslations = 4;
 
 std::string NatWords(int nLevel) {
     if (nLevel < 0) {
@@ -72,20 +82,34 @@ std::string OneLine(const DetectResult& result) {
     return ToWords(WayOf(result)) + (szName.empty() ? "" : ", " + szName);
 }
 
-void AddEnvironment(const DetectResult& result, Reply& reply) {
+bool CanBeReported() {
+    DetectResult detected = {};
+    const bool blWhole = TLibGetRouterDetectResult(&detected) == 0;
+    const Way enWay = WayOf(detected);
+    return blWhole && (enWay == Way::kUpnp || enWay == Way::kNatpmp);
+}
+
+void AddEnvironment(const DetectResult& result, const TAVO_NET_GATEWAY_WORD& word, Reply& reply) {
+    constexpr const char* kKinds[] = {"unknown", "public", "private", "carrier"};
     reply.jsAnswer["gateway"] = TextOrNull(result.szGateway);
     reply.jsAnswer["interface"] = TextOrNull(result.szInterface);
     reply.jsAnswer["error_code"] = result.errCode;
     reply.jsAnswer["environment_flags"] = result.nEnvFlags;
+    reply.jsAnswer["outside"] = TextOrNull(word.szOutside);
+    reply.jsAnswer["outside_kind"] = kKinds[word.enOutside];
+    const bool blCarrier = word.enOutside == TAVO_NET_ADDRESS_CARRIER;
     for (const Warning& warning : kWarnings) {
-        if ((result.nEnvFlags & warning.nFlag) != 0) {
+        if ((result.nEnvFlags & warning.nFlag) != 0 && !(blCarrier && warning.nFlag == kManyTranslations)) {
             reply.rgszWarnings.emplace_back(warning.szText);
         }
     }
+    if (blCarrier) {
+        reply.rgszWarnings.emplace_back(kCarrier);
+    }
 }
 
-void DescribeVerdict(const DetectResult& result, Reply& reply) {
-    AddEnvironment(result, reply);
+void DescribeVerdict(const DetectResult& result, const TAVO_NET_GATEWAY_WORD& word, Reply& reply) {
+    AddEnvironment(result, word, reply);
     // Only a detection fills these; a remembered verdict has no surroundings.
     const bool blFresh = result.nProgress > 0;
     reply.jsAnswer["public_ip_level"] =
@@ -94,7 +118,7 @@ void DescribeVerdict(const DetectResult& result, Reply& reply) {
     const std::string szInterface = Clean(result.szInterface);
     reply.szBody += Columns({
         {"gateway", Clean(result.szGateway) + (szInterface.empty() ? "" : " through " + szInterface)},
-        {"driven by", ToWords(WayOf(result))},
+        {"driven by", WayOf(result) == Way::kManual ? "its own pages at best" : ToWords(WayOf(result))},
         {"UPnP", SupportWord(result.enSupportUpnp)},
         {"NAT-PMP", SupportWord(result.enSupportNatpmp)},
         {"brand", Clean(result.szBrand)},
@@ -103,22 +127,39 @@ void DescribeVerdict(const DetectResult& result, Reply& reply) {
         {"its name", Clean(result.szUserSettingName)},
         {"description", Clean(result.szUpnpPfPath)},
         {"holds", WayOf(result) == Way::kManual ? "" : CapacityWords(result.nMaxRule)},
+        {"address outside", Clean(word.szOutside)},
         {"NATs on the way out", blFresh ? NatWords(result.nPublicIPLevel) : ""},
     });
 }
 
-Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, int nMaxRules) {
-    // The error is 1 also after success: only the result tells, and the two causes that have a number.
+Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, int nMaxRules, bool blLocked) {
+    std::optional<Lock> lock;
+    if (!blLocked && !lock.emplace().IsHeld()) {
+        return Busy();
+    }
+    const Way enWay = WayOf(conf.szSupportUpnp, conf.szSupportNatpmp);
+    const bool blDaemon = enWay == Way::kUpnp || enWay == Way::kNatpmp;
+    if (blDaemon && !KeepAccount(szGateway)) {
+        return Failure(
+            "nothing was changed: the account of the router's pages could not be put aside in "
+            "/etc/portforward/router_account.conf; is the disk full or read-only ('df /etc')?");
+    }
+    // The error is 1 also after success: only the result tells, and the cause that has a number.
     auto enError = TAVO_LIBTAVOPORTMAP_ERR_FAILED;
-    if (TLibSetRouterConf(szGateway.c_str(), &conf, &enError, true) != 0) {
-        if (enError == TAVO_LIBTAVOPORTMAP_ERR_CONFLICT) {
-            return Busy();
-        }
+    if (TLibSetRouterConf(szGateway.c_str(), &conf, &enError, false) != 0) {
         return Failure(enError == TAVO_LIBTAVOPORTMAP_ERR_SYNTAX_VERSION
                            ? "the router's description is newer than the tool that carries it out; update the tool "
                              "(/usr/tavo/bin/tavoportforward). The old settings are still there"
                            : "the settings could not be stored; the old ones are still there, and the system log says "
                              "why");
+    }
+    if (!blDaemon) {
+        DropAccount();
+    }
+    // Without a record nothing can be saved, not even where no limit is known.
+    int nKnown = -1;
+    if (blDaemon && nMaxRules < 0 && !RouterUpnpDB(conf.szBrand, conf.szModel, conf.szVersion).GetMaxRule(nKnown)) {
+        nMaxRules = 0;
     }
     if (nMaxRules >= 0) {
         if (const auto szFault = RecordMaxRules(conf, nMaxRules)) {

@@ -6,6 +6,7 @@
 
 #include "Answer.h"
 #include "Box.h"
+#include "tavo/net.h"
 
 namespace tavo::cli {
 
@@ -19,12 +20,16 @@ std::string CapacityWords(int nMaxRules);
 // How the router is driven and what it is, on one line.
 std::string OneLine(const DetectResult& result);
 
-// Adds what is wrong with the surroundings, and what to do about it, as warnings.
-void AddEnvironment(const DetectResult& result, Reply& reply);
-// Adds the whole verdict: body, JSON and warnings.
-void DescribeVerdict(const DetectResult& result, Reply& reply);
+// Whether a report about the detected router can be made: its settings go into it.
+bool CanBeReported();
 
-// Stores the settings of the current gateway, and the limit where nMaxRules is not negative.
-Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, int nMaxRules);
+// Adds what is wrong with the surroundings, and what to do about it, as warnings. word: what the gateway says itself.
+void AddEnvironment(const DetectResult& result, const TAVO_NET_GATEWAY_WORD& word, Reply& reply);
+// Adds the whole verdict: body, JSON and warnings.
+void DescribeVerdict(const DetectResult& result, const TAVO_NET_GATEWAY_WORD& word, Reply& reply);
+
+// Stores the settings of the current gateway, and how many rules it holds; below 0: what is recorded, else that no
+// limit is known. An account of the router's pages is kept. blLocked: the caller holds the router lock.
+Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, int nMaxRules, bool blLocked = false);
 
 }  // namespace tavo::cli

@@ -5,6 +5,7 @@
 #include <string_view>
 
 #include "Commands.h"
+#include "Setup.h"
 #include "Completions.h"
 #include "Usage.h"
 
@@ -14,7 +15,7 @@ namespace {
 
 constexpr char kFooter[] =
     "First steps:\n"
-    "  tavoportmap detect --save      find out what the router is and remember it\n"
+    "  tavoportmap setup              find out what the router is and remember it\n"
     "  tavoportmap rules add web --router-port 443 --box-port 8443\n"
     "  tavoportmap save               write the rules to the router\n\n"
     "Exit codes: 0 done, 1 failed, 2 wrong arguments, 3 another operation is running,\n"
@@ -49,6 +50,7 @@ Reply Answer(int argc, char** argv, Request& request) {
     app.set_help_flag("-h,--help", "print this help");
     app.set_version_flag("--version", "tavoportmap " TAVO_VERSION, "print the version");
     app.add_flag("--json", request.blJson, "answer with one JSON document");
+    OfferSetup(app, request);
     OfferOpen(app, request);
     OfferClose(app, request);
     OfferDetect(app, request);

@@ -2,8 +2,8 @@
 // status limit limit2" or "result status ports", "write" at the end: the rules are stored), TAVO_DETECT ("result error
 // flags level upnp natpmp max percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result
 // status brand support max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged),
-// TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53", other hosts' mappings). Promises: calls
-// back and logs as the library does.
+// TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53", other hosts' mappings), TAVO_WORD ("there
+// natpmp outside kind", the gateway's own word). Promises: calls back and logs as the library does.
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -15,6 +15,7 @@
 #include <string>
 
 #include "libtavoportmap.h"
+#include "tavo/net.h"
 #include "tavo/upnp.h"
 
 namespace {
@@ -100,6 +101,26 @@ int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
     pfnCallback(pResult, pData);
     pResult->nProgress = nResult == 0 ? 100 : pResult->nProgress;
     return nResult;
+}
+
+// UPnP is answered where the detection has a word on it, and with "able" whatever it has.
+bool UpnpDetector::IsAbleToGetBrandModelVersion() {
+    std::istringstream wanted(std::getenv("TAVO_DETECT") == nullptr ? "" : std::getenv("TAVO_DETECT"));
+    int nSupport = 0;
+    for (int i = 0; i < 5; ++i) {
+        wanted >> nSupport;
+    }
+    return nSupport != 0 || Wants("TAVO_DETECT", "able");
+}
+
+int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
+    std::istringstream wanted(std::getenv("TAVO_WORD") == nullptr ? "1 -1" : std::getenv("TAVO_WORD"));
+    std::string szOutside;
+    int nKind = 0;
+    wanted >> pWord->nThere >> pWord->nNatpmp >> szOutside >> nKind;
+    std::snprintf(pWord->szOutside, sizeof(pWord->szOutside), "%s", szOutside.c_str());
+    pWord->enOutside = static_cast<TAVO_NET_ADDRESS_KIND>(nKind);
+    return 0;
 }
 
 int TLibTestUpnpCompatibility(int, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* pResult,

@@ -138,7 +138,7 @@ class Tool(unittest.TestCase):
 
     def test_help_and_man_page_know_every_command_and_option(self):
         page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
-        for command in ("", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
+        for command in ("", "setup", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
                         "rules enable", "rules disable", "rules edit", "rules discard", "rules import", "rules export",
                         "open", "close", "off", "on", "save", "status", "compat", "test", "report", "diag", "diag parse-ports",
                         "diag to-ports", "diag rules", "diag used-ports", "diag conflicts", "diag test", "diag set",
@@ -425,7 +425,7 @@ class Tool(unittest.TestCase):
 
     def test_saving_by_the_library_itself(self):
         tool("rules", "add", "--router-port", "80")
-        self.expect("save", FAILED, "nothing is known of the router 192.168.77.1 yet(?s:.)*detect --save")
+        self.expect("save", FAILED, "nothing is known of the router 192.168.77.1 yet(?s:.)*tavoportmap setup")
         put(ROUTER, (KNOWN % ("yes", "no")).replace(GATEWAY, "10.0.0.1").replace("R1", "R2"))
         self.expect("save", FAILED, r"is about another router \(10.0.0.1\) than 192.168.77.1")
         put(ROUTER, (KNOWN % ("yes", "no")).replace("R1", "R2"))
@@ -457,20 +457,70 @@ class Tool(unittest.TestCase):
 
     def test_verdicts_of_detection(self):
         steps = "10 20 30 40 70 50 80"
-        for answer, code, pattern in (
-                (f"0 0 0 1 1 0 32 {steps}", OK, r"driven by +UPnP\n(?s:.)*Acme\\x1b(?s:.)*holds +32 rules(?s:.)*--last --save"),
-                (f"0 0 0 1 2 1 0 {steps}", OK, "driven by +NAT-PMP(?s:.)*no limit known"),
-                (f"0 0 0 1 0 0 -1 {steps}", OK, "driven by +manual(?s:.)*--conn-type http"),
-                (f"0 0 0 1 2 0 -1 {steps}", OK, "driven by +unknown(?s:.)*--trust-upnp"),
-                (f"0 0 5 2 1 0 32 {steps}", OK, "(?s)gateway setting.*double NAT.*bridge.*outer router, too.*public address"),
-                (f"0 0 2 -1 1 0 32 {steps}", OK, "could not be found out whether another router"),
-                (f"-1 0 0 1 1 0 -1 {steps}", FAILED, "(?s)driven by +UPnP.*not in the compatibility database.*--max-rules"),
-                ("-1 2 0 0 0 0 -1 10", BUSY, "another port-forwarding operation"),
-                ("-1 3 0 0 0 0 -1 10 20 30 40", FAILED, "Internet cannot be reached"),
-                ("-1 4 0 1 0 0 -1 10 20 30 40 70 50", FAILED, "names cannot be resolved"),
-                ("-1 0 0 0 0 0 -1 10 20", FAILED, "no network interface is up")):
-            self.expect("detect", code, pattern, LD_PRELOAD=STAND_IN, TAVO_DETECT=answer)
-            self.assertEqual(self.json("detect", LD_PRELOAD=STAND_IN, TAVO_DETECT=answer)[0], code)
+        for answer, word, code, pattern in (
+                (f"0 0 0 1 1 0 32 {steps}", "1 -1", OK,
+                 r"driven by +UPnP\n(?s:.)*Acme\\x1b(?s:.)*holds +32 rules(?s:.)*--last --save"),
+                (f"0 0 0 1 2 1 0 {steps}", "1 0 198.51.100.7 1", OK, "NAT-PMP(?s:.)*no limit known(?s:.)*outside +198.51.100.7"),
+                (f"0 0 0 1 0 0 -1 {steps}", "1 -1", OK,
+                 "(?s)answers neither UPnP nor NAT-PMP.*http://192.168.77.1/, then run 'tavoportmap setup'.*--conn-type http"),
+                (f"0 0 0 1 0 0 -1 {steps}", "1 0 198.51.100.7 1", OK, "answers NAT-PMP; 'tavoportmap setup'"),
+                (f"0 0 0 1 0 0 -1 {steps}", "1 2", OK, "refuses to be used: switch it, or UPnP, on"),
+                (f"0 0 0 0 0 0 -1 {steps}", "1 -1", OK, "no router stands in the way"),
+                (f"0 0 0 1 0 0 -1 {steps} able", "1 -1", OK, "database says that its model cannot be relied on; 'tavoportmap setup'"),
+                (f"0 0 0 1 2 0 -1 {steps}", "1 -1", OK, "nobody has recorded how far its model(?s:.)*'tavoportmap setup'"),
+                (f"0 0 5 2 1 0 32 {steps}", "1 0 10.0.0.2 2", OK,
+                 "(?s)gateway setting.*double NAT.*bridge.*outer router, too.*public address"),
+                (f"0 0 4 2 1 0 32 {steps}", "1 0 100.64.0.2 3", OK, "(?s)warning: the provider translates.*public IPv4 address"),
+                (f"0 0 2 -1 1 0 32 {steps}", "1 -1", OK, "could not be found out whether another router"),
+                (f"-1 0 0 1 1 0 -1 {steps}", "1 -1", OK, "(?s)driven by +UPnP.*recorded how many rules.*--max-rules"),
+                ("-1 2 0 0 0 0 -1 10", "1 -1", BUSY, "another port-forwarding operation"),
+                ("-1 3 0 0 0 0 -1 10 20 30 40", "1 -1", FAILED, "is there, but the Internet cannot be reached"),
+                ("-1 3 0 0 0 0 -1 10 20 30 40", "0 -1", FAILED, "router 192.168.77.1 does not answer at all"),
+                ("-1 4 0 1 0 0 -1 10 20 30 40 70 50", "1 -1", FAILED, "names cannot be resolved"),
+                ("-1 0 0 0 0 0 -1 10 20", "1 -1", FAILED, "no network interface is up")):
+            world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": answer, "TAVO_WORD": word}
+            self.expect("detect", code, pattern, **world)
+            self.assertEqual(self.json("detect", **world)[0], code)
+
+    def test_setup_leads_from_nothing_to_a_known_router(self):
+        """Each case: what detection, the gateway and the test say; exit code and words; what is stored then."""
+        steps = "10 20 30 40 70 50 80"
+        passed, failed = "0 0 Acme yes 32 10 20 30 60 40 50 70 80 90", "1 0 Acme no -1 10 20 30"
+        pages = (KNOWN % ("no", "no")) + 'conn_type="http"\nconn_port="80"\nuser="me"\n'
+        for before, detected, word, tested, code, pattern, stored in (
+                ("", f"0 0 0 1 1 0 32 {steps}", "1 -1", passed, OK, "is known now and is driven by UPnP", ("yes", "no")),
+                ("", f"0 0 0 1 2 0 -1 {steps}", "1 0 198.51.100.7 1", passed, OK, "known now(?s:.)*UPnP", ("yes", "no")),
+                ("", f"0 0 0 1 2 0 -1 {steps}", "1 0 198.51.100.7 1", failed, OK, "UPnP failed the test.*NAT-PMP is used", ("no", "yes")),
+                ("", f"0 0 0 1 2 0 -1 {steps}", "1 -1", failed, FAILED,
+                 "(?s)did not take the test mappings.*newer firmware.*--trust-upnp.*routers BRAND", None),
+                ("", f"0 0 0 1 2 0 -1 {steps}", "1 -1", "-1 13 - - 0 10 20", FAILED, "no router answered", None),
+                ("", f"0 0 0 1 0 0 -1 {steps}", "1 0 198.51.100.7 1", "", OK, "driven by NAT-PMP", ("no", "yes")),
+                ("", f"0 0 0 1 0 0 -1 {steps}", "1 3", "", OK, "NAT-PMP(?s:.)*no connection outside at the moment|no connection "
+                 "outside at the moment(?s:.)*", ("no", "yes")),
+                ("", f"0 0 0 1 0 0 -1 {steps} able", "1 -1", "", FAILED, "(?s)use it all the same.*router set --brand 'Acme", None),
+                ("", f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "(?s)http://192.168.77.1/, then run 'tavoportmap setup' again", None),
+                (KNOWN % ("yes", "no"), f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "stored of it stays as it is", ("yes", "no")),
+                (pages, f"0 0 0 1 1 0 -1 {steps}", "1 -1", "", OK, "own pages(?s:.)*router set --upnp yes|router set --upnp yes(?s:.)*own pages", ("no", "no")),
+                ("\0\1 no settings", f"0 0 0 1 1 0 32 {steps}", "1 -1", "", OK, "kept as .*router.conf.unreadable", ("yes", "no")),
+                ("", "-1 3 0 0 0 0 -1 10 20 30 40", "0 -1", "", FAILED, "is the cable", None)):
+            self.setUp()
+            describe("Acme", "R1", "1")
+            if before:
+                put(ROUTER, before)
+            world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": detected, "TAVO_WORD": word, "TAVO_COMPAT": tested}
+            self.expect("setup --yes", code, pattern, **world)
+            words = tuple(re.findall(r'support_router_\w+="(\w+)"', get(ROUTER))) if os.path.exists(ROUTER) else None
+            self.assertEqual(words, stored, (detected, word, tested))
+            if stored == ("yes", "no") and code == OK:
+                self.expect("setup", OK, "known now", **world)  # anew; what was recorded needs no second test
+        world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": f"0 0 0 1 2 0 -1 {steps}", "TAVO_COMPAT": passed}
+        self.setUp()
+        self.expect("setup", FAILED, "setup --yes +tests it and stores", **world)
+        self.assertFalse(self.json("setup", **world)[1]["ok"])
+        code, text = on_terminal("setup", typed=b"n\n", **world)
+        self.assertEqual((code, "Test it now?" in text, os.path.exists(ROUTER)), (FAILED, True, False), text)
+        code, text = on_terminal("setup", typed=b"y\n\n", **world)
+        self.assertEqual((code, os.path.exists(ROUTER)), (OK, True), text)
 
     def test_the_child_of_detection_says_nothing(self):
         for ending in ("child", "child callback"):
@@ -481,7 +531,7 @@ class Tool(unittest.TestCase):
         self.expect("router show", OK, "nothing is stored for the router 192.168.77.1 yet")
         self.expect("router set --brand Acme --upnp no", USAGE, "needs --conn-type and --conn-port")
         self.expect("router set --upnp yes --brand Acme --model R9 --version 2", OK, "stored as the settings")
-        self.expect("router show", OK, "driven by +UPnP\n(?s:.)*holds +unknown(?s:.)*nobody has recorded how many rules")
+        self.expect("router show", OK, "driven by +UPnP\n(?s:.)*holds +no limit known")
         self.expect("router set --max-rules 20", OK, "stored as the settings")
         self.expect("router show", OK, "model +R9\n(?s:.)*holds +20 rules\n")
         self.expect("router set --model R1 --version 1 --max-rules 20", FAILED, "says that this router holds 1 rules")
@@ -515,6 +565,13 @@ class Tool(unittest.TestCase):
         code, out, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
         self.assertEqual(code, OK, err)
         self.expect("router show --show-password", OK, "user +admin\npassword +n3w\n")
+        # UPnP for a while: the account is put aside, and comes back by itself.
+        self.expect("router set --upnp yes", OK, "stored as the settings")
+        self.assertNotIn("n3w", get(ROUTER))
+        self.assertEqual(os.stat(f"{CONF}/router_account.conf").st_mode & 0o777, 0o600)
+        self.expect("router set --upnp no", OK, "stored as the settings")
+        self.expect("router show --show-password", OK, "user +admin\npassword +n3w\nconnection +http, port 80")
+        self.assertFalse(os.path.exists(f"{CONF}/router_account.conf"))
 
     # ---- router tests ---------------------------------------------------------------------------
 
@@ -524,7 +581,7 @@ class Tool(unittest.TestCase):
                 (f"0 0 Zeta yes 32 {whole}", OK, "works(?s:.)*holds +32 rules\n(?s:.)*not recorded", None, 32),
                 (f"0 0 Zeta yes 60 {whole}", OK, "60 rules at least, as many as were tried", None, 60),
                 (f"0 0 - - 0 {whole}", OK, "nothing can be recorded of it", None, None),
-                ("1 0 Zeta no -1 10 20 30", FAILED, "did not take the test mappings(?s:.)*tavoportmap report", "add", None),
+                ("1 0 Zeta no -1 10 20 30", FAILED, "did not take the test mappings(?s:.)*router.log\n", "add", None),
                 ("1 0 Zeta no -1 10 20 30 60", FAILED, "holds none of the mappings that it said yes to", "count", None),
                 ("1 0 Zeta no -1 10 20 30 60 40", FAILED, "did not take the mappings away", "delete", None),
                 ("1 18 - - 0 10 20 30 60 40 50", FAILED, "ports of deleted mappings are still open", "closed", None),
@@ -553,7 +610,8 @@ class Tool(unittest.TestCase):
                     TAVO_COMPAT="0 0 Acme yes 7 10 90")
         for answer, recorded in ((b"y\n", True), (b"\n", False)):
             code, text = on_terminal("compat", typed=answer, **passed)
-            self.assertEqual((code, "Record it?" in text, "\nrecorded: " in text.replace("\r", "")), (OK, True, recorded))
+            self.assertEqual((code, text.index("every step passed") < text.index("Record it?"), "not recorded" in text),
+                             (OK, True, not recorded))
 
     def test_a_signal_ends_a_test_that_hangs(self):
         for number in (signal.SIGINT, signal.SIGTERM):
@@ -610,8 +668,8 @@ class Tool(unittest.TestCase):
         settings = KNOWN % ("yes", "no")
         put(ROUTER, settings)
         known = {"LD_PRELOAD": STAND_IN, "TAVO_LAST": "1 Acme"}
-        self.expect("report", FAILED, "'tavoportmap detect' comes first")
-        self.expect("report", FAILED, "without an account of its pages", LD_PRELOAD=STAND_IN, TAVO_LAST="2 Acme")
+        self.expect("report", FAILED, "'tavoportmap detect' looks for it")
+        self.expect("report", FAILED, "which this one is not(?s:.)*router.log", LD_PRELOAD=STAND_IN, TAVO_LAST="2 Acme")
         for path in files:
             if os.path.exists(path):
                 os.unlink(path)

@@ -29,7 +29,8 @@ NatPmpWord ReadAnswer(int fd) {
     if (nSize < static_cast<ssize_t>(kAddressAt) || rgAnswer[0] != 0 || rgAnswer[1] != kAnswerKind) {
         return {};
     }
-    NatPmpWord word{.nCode = rgAnswer[kCodeAt] << 8U | rgAnswer[kCodeAt + 1]};
+    NatPmpWord word;
+    word.nCode = static_cast<int>(rgAnswer[kCodeAt] << 8U | rgAnswer[kCodeAt + 1]);
     in_addr address = {};
     if (word.nCode == 0 && nSize == static_cast<ssize_t>(kAnswerSize)) {
         std::memcpy(&address, rgAnswer + kAddressAt, sizeof(address));

@@ -1,0 +1,117 @@
+// Chooses among the listeners and shows them. Relies on the kernel's range of ports for programs that only ask.
+// Promises: see Offer.h.
+#include "Offer.h"
+
+#include <arpa/inet.h>
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <fstream>
+#include <iterator>
+
+#include "Listeners.h"
+#include "PortNames.h"
+#include "RuleStore.h"
+#include "tavo/net.h"
+
+namespace tavo::cli {
+
+namespace {
+
+// Of use on the home network alone: addresses, names, times and the search for devices; and our own daemons' ports.
+constexpr uint16_t kHomePorts[] = {67, 68, 69, 123, 137, 138, 546, 547, 1900, 3702, 5350, 5351, 5353, 5355};
+
+struct Range {
+    unsigned nFirst = 32768;
+    unsigned nLast = 60999;
+};
+
+// The ports that the kernel gives to programs which only want an answer.
+Range BorrowedPorts() {
+    Range range;
+    std::ifstream("/proc/sys/net/ipv4/ip_local_port_range") >> range.nFirst >> range.nLast;
+    return range;
+}
+
+std::string OwnAddress(const std::string& szGateway) {
+    char szLocal[INET_ADDRSTRLEN] = {};
+    return TAVONetLocalAddressGet(szGateway.c_str(), szLocal, sizeof(szLocal), nullptr, 0) == 0 ? szLocal : "";
+}
+
+bool IsForwarded(const Rules& rules, const Listener& listener) {
+    return std::any_of(rules.begin(), rules.end(), [&](const Rule& rule) {
+        const auto rgPorts = ParsePorts(rule.szBoxPorts);
+        return rule.blEnabled && (rule.szProtocol == listener.szProtocol || rule.szProtocol == "all") && rgPorts &&
+               std::find(rgPorts->begin(), rgPorts->end(), listener.nPort) != rgPorts->end();
+    });
+}
+
+// What somebody outside could want to reach.
+std::vector<Listener> Candidates(const std::string& szGateway) {
+    const std::string szOwn = OwnAddress(szGateway);
+    const Range borrowed = BorrowedPorts();
+    const Rules rules = LoadRules().value_or(Rules());
+    std::vector<Listener> rgFound;
+    for (const Listener& listener : ReadListeners()) {
+        const bool blReachable = listener.szAddress == "0.0.0.0" || listener.szAddress == "::" ||
+                                 listener.szAddress == szOwn || listener.szAddress == "::ffff:" + szOwn;
+        const bool blHome =
+            std::find(std::begin(kHomePorts), std::end(kHomePorts), listener.nPort) != std::end(kHomePorts);
+        // The kernel's own sockets, such as WireGuard's, have no program.
+        const bool blAsksOnly = listener.szProtocol == "udp" && !listener.szProgram.empty() && !listener.blContainer &&
+                                listener.nPort >= borrowed.nFirst && listener.nPort <= borrowed.nLast;
+        const bool blTwice = std::any_of(rgFound.begin(), rgFound.end(), [&](const Listener& found) {
+            return found.nPort == listener.nPort && found.szProtocol == listener.szProtocol;
+        });
+        if (blReachable && !listener.blLoopbackOnly && !blHome && !blAsksOnly && !blTwice &&
+            !IsForwarded(rules, listener)) {
+            rgFound.push_back(listener);
+        }
+    }
+    return rgFound;
+}
+
+std::string NameOf(const Listener& listener) {
+    return fmt::format("{}{}", listener.nPort, listener.szProtocol == "udp" ? "/udp" : "");
+}
+
+std::string WhoListens(const Listener& listener) {
+    return listener.szProgram.empty() ? (listener.blContainer ? "a container" : "the system")
+                                      : Clean(listener.szProgram);
+}
+
+Json::Value ToJson(const Listener& listener, const std::string& szRisk) {
+    Json::Value js;
+    js["port"] = listener.nPort;
+    js["protocol"] = listener.szProtocol;
+    js["program"] = listener.szProgram.empty() ? Json::Value() : Json::Value(listener.szProgram);
+    js["container"] = listener.blContainer;
+    js["risk"] = szRisk.empty() ? Json::Value() : Json::Value(szRisk);
+    return js;
+}
+
+}  // namespace
+
+void OfferListeners(const std::string& szGateway, Reply& reply) {
+    const std::vector<Listener> rgFound = Candidates(szGateway);
+    reply.jsAnswer["could_be_opened"] = Json::arrayValue;
+    std::string szTable, szSafe;
+    for (const Listener& listener : rgFound) {
+        const std::string szRisk = WhyRisky(listener.nPort);
+        reply.jsAnswer["could_be_opened"].append(ToJson(listener, szRisk));
+        szTable += fmt::format("  {:<10} {:<16}{}\n", NameOf(listener), WhoListens(listener),
+                               szRisk.empty() ? "" : " better not: " + szRisk);
+        szSafe = szSafe.empty() && szRisk.empty() ? NameOf(listener) : szSafe;
+    }
+    if (rgFound.empty()) {
+        reply.szMessage +=
+            "\nno program here waits for connections that is not forwarded yet; 'tavoportmap open PORT' "
+            "opens a port for one that is still to come";
+        return;
+    }
+    reply.szBody += "\nlistens on this box and is not forwarded:\n" + szTable;
+    reply.szMessage += fmt::format("\n'tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
+                                   szSafe.empty() ? "a port" : "the first of them that is fit for it");
+}
+
+}  // namespace tavo::cli
