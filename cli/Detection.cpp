@@ -153,7 +153,7 @@ std::string FindingWords(Finding enFinding, const Detected& detected) {
     const std::string szRouter = Clean(detected.szGateway);
     switch (enFinding) {
         case Finding::kKnown:
-            return fmt::format("the router {} is driven by {}", szRouter, ToWords(WayOf(result)));
+            return fmt::format("the router {} can be driven by {}", szRouter, ToWords(WayOf(result)));
         case Finding::kUntested:
             return fmt::format("the router {} answers UPnP, and nobody has recorded how far its model can be relied on",
                                szRouter);

@@ -12,6 +12,7 @@
 #include "Listeners.h"
 #include "PortNames.h"
 #include "RuleStore.h"
+#include "Table.h"
 #include "tavo/net.h"
 
 namespace tavo::cli {
@@ -95,12 +96,12 @@ Json::Value ToJson(const Listener& listener, const std::string& szRisk) {
 void OfferListeners(const std::string& szGateway, Reply& reply) {
     const std::vector<Listener> rgFound = Candidates(szGateway);
     reply.jsAnswer["could_be_opened"] = Json::arrayValue;
-    std::string szTable, szSafe;
+    Table table({"port", "program", "remark"});
+    std::string szSafe;
     for (const Listener& listener : rgFound) {
         const std::string szRisk = WhyRisky(listener.nPort);
         reply.jsAnswer["could_be_opened"].append(ToJson(listener, szRisk));
-        szTable += fmt::format("  {:<10} {:<16}{}\n", NameOf(listener), WhoListens(listener),
-                               szRisk.empty() ? "" : " better not: " + szRisk);
+        table.Add({NameOf(listener), WhoListens(listener), szRisk.empty() ? "" : "better not: " + szRisk});
         szSafe = szSafe.empty() && szRisk.empty() ? NameOf(listener) : szSafe;
     }
     if (rgFound.empty()) {
@@ -109,7 +110,7 @@ void OfferListeners(const std::string& szGateway, Reply& reply) {
             "opens a port for one that is still to come";
         return;
     }
-    reply.szBody += "\nlistens on this box and is not forwarded:\n" + szTable;
+    reply.szBody += "\nlistens on this box and is not forwarded:\n" + table.ToText();
     reply.szMessage += fmt::format("\n'tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
                                    szSafe.empty() ? "a port" : "the first of them that is fit for it");
 }

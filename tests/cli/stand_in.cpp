@@ -3,7 +3,9 @@
 // flags level upnp natpmp max percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result
 // status brand support max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged),
 // TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53", other hosts' mappings), TAVO_WORD ("there
-// natpmp outside kind", the gateway's own word). Promises: calls back and logs as the library does.
+// natpmp outside kind", the gateway's own word), TAVO_UID (who asks). Promises: calls back and logs as the library
+// does.
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -172,6 +174,11 @@ int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* pResult) {
     Fill(pResult->szBrand, szBrand.c_str());
     Fill(pResult->szModel, szBrand.empty() ? "" : "R1");
     return 0;
+}
+
+uid_t geteuid() {
+    const char* szUser = std::getenv("TAVO_UID");
+    return szUser == nullptr ? static_cast<uid_t>(syscall(SYS_geteuid)) : static_cast<uid_t>(std::atoi(szUser));
 }
 
 int TAVOUpnpInit(int, int) {

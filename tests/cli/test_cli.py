@@ -239,6 +239,11 @@ class Tool(unittest.TestCase):
             self.assertEqual(self.json("save")[1]["status"], 2)
         self.expect("rules remove 1", OK, "noted")
 
+    def test_without_root_the_way_out_is_sudo(self):
+        for arguments in ("setup", "detect", "router show", "router set --upnp yes", "compat", "report"):
+            self.expect(arguments, FAILED, r"^error: this command needs root: run it with sudo\n$", LD_PRELOAD=STAND_IN,
+                        TAVO_UID="1000")
+
     def test_an_answer_that_cannot_be_written_is_a_failure(self):
         with open("/dev/full", "w", encoding="utf-8") as full:
             self.assertEqual(subprocess.run([TOOL, "rules", "list"], stdout=full, check=False).returncode, FAILED)

@@ -10,12 +10,12 @@ NAME = "home.example"
 class Outside:
     """What the box expects outside: a host that answers, and a name server."""
 
-    def __init__(self, lab):
+    def __init__(self, lab, avahi=True):
         self.lab = lab
         self.names = None
         lab.start("wan", "/usr/bin/python3", f"{HERE}/echo.py", "serve", str(WAN_PORT))
         lab.write("/etc/resolv.conf", f"nameserver {WAN}\n")
-        self.bus, self.publisher = lab.start_avahi()
+        self.bus, self.publisher = lab.start_avahi() if avahi else (None, None)
         self.settings()
         self.start_names()
 

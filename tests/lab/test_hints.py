@@ -1,0 +1,315 @@
+"""Walks the hints: what the tool recommends is done there and then, in every state that it can be in, and leads on.
+
+A hint is a command of the tool in quotes, or on a line of its own. One that comes after "then" is done after what the
+sentence asks for before it. A hint leads on when it succeeds, or fails with other words, which are walked in their turn;
+words that come back on the same way are a circle. No hint may be wrong usage.
+"""
+import fcntl
+import os
+import pty
+import re
+import shlex
+import shutil
+import signal
+import unittest
+
+import homelab
+import networks
+from homelab import BUILD, GATEWAY, LAN2, sh, wait_for
+
+LAB = OUTSIDE = None
+TOOL = f"{BUILD}/cli/tavoportmap"
+CONF = "/etc/portforward"
+OK, USAGE = 0, 2
+# What a hint leaves for the user to fill in; the model is the one that is described in the lab.
+WORDS = {"BRAND": "Alderman", "MODEL": "'Homestead 2'", "VERSION": "1.0", "NAME": "admin", "NUMBER": "32", "PORT": "8443",
+         "ID": "1"}
+QUOTED = re.compile(r"(\bthen (?:run )?)?'tavoportmap\s+([^']*(?:'\\\\''[^']*)*)'")
+LINE = re.compile(r"^[ ]+(?:- )?tavoportmap (.+?)(?:  .*)?$", re.M)
+OTHER = re.compile(r"'((?:ip|journalctl|df|systemctl) [^']*)'")
+
+
+def hints(text):
+    """(command, whether something else is to be done before it), in the order of the text."""
+    text = re.sub(r"\\\n\s*", "", text)
+    found = [(m.start(), m[2], bool(m[1])) for m in QUOTED.finditer(text)]
+    found += [(m.start(), m[1], False) for m in LINE.finditer(text)]
+    unique = {}
+    for _, command, later in sorted(found):
+        unique.setdefault(re.sub(r"\b[A-Z]+\b", lambda m: WORDS.get(m[0], m[0]), command.strip()), later)
+    return list(unique.items())
+
+
+def run(command):
+    """Exit code and words; a command that asks for a password gets a terminal."""
+    if "--user" not in command and "--ask-password" not in command:
+        done = LAB.run("box", f"{TOOL} {command}", check=False, stdin=homelab.subprocess.DEVNULL, timeout=120)
+        return done.returncode, done.stdout + done.stderr
+    pid, fd = pty.fork()
+    if pid == 0:
+        os.execvp("ip", ["ip", "netns", "exec", "box", TOOL, *shlex.split(command)])
+    os.write(fd, b"secret\n")
+    text = b""
+    try:
+        while chunk := os.read(fd, 4096):
+            text += chunk
+    except OSError:  # the other side is closed
+        pass
+    os.close(fd)
+    return os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), text.decode().replace("\r", "")
+
+
+def words_of(text):
+    """What makes a message the same as another one: no progress, no numbers that count up."""
+    return re.sub(r"(?m)^ *\d+ % .*$", "", text).strip()
+
+
+class Hints(unittest.TestCase):
+    """Each case is a state: how it comes about, how a user ends it (for what comes "then"), and what he may type."""
+
+    def setUp(self):
+        self.told = {}
+        self.walked = []
+        self.keep = []
+
+    def tearDown(self):
+        self.clear()
+
+    def clear(self):
+        for undo in reversed(self.keep):
+            undo()
+        self.keep = []
+        LAB.stop_daemon(signal.SIGKILL)
+        if LAB.router is not None:
+            LAB.stop_router()
+        LAB.router = None
+        LAB.clear_state(*(f"{CONF}/{name}" for name in os.listdir(CONF)))
+        shutil.rmtree("/etc.defaults/portforward/routerdb", ignore_errors=True)
+        LAB.install()
+        OUTSIDE.settings()
+        os.unlink(f"{CONF}/router.conf")
+        LAB.write(f"{CONF}/router_upnp.db", "")
+
+    def do(self, command, arrange, remedy=None):
+        """The command in a fresh state; each is done once."""
+        key = (command, remedy is not None)
+        if key not in self.told:
+            self.clear()
+            arrange()
+            if remedy:
+                remedy()
+            self.told[key] = run(command)
+        return self.told[key]
+
+    def walk(self, command, arrange, remedy, path=()):
+        code, text = self.do(command, arrange)
+        words = words_of(text)
+        way = [*path, (command, code, words)]
+        shown = "\n".join(f"--- {step} -> {status}\n{said}" for step, status, said in way)
+        self.assertNotEqual(code, USAGE, f"a hint that is no command:\n{shown}")
+        self.assertNotIn(words, [said for _, _, said in path], f"a circle:\n{shown}")
+        for other in OTHER.findall(text):
+            self.assertTrue(shutil.which(other.split()[0]) or other.startswith(("journalctl", "systemctl")), shown)
+        self.walked.append(command)
+        for hint, later in hints(text):
+            if hint == "test --help" or "--help" in hint:
+                self.assertEqual(run(hint)[0], OK, shown)
+            elif later:
+                self.assertIsNotNone(remedy, f"nothing can be done before {hint!r}:\n{shown}")
+                after, said = self.do(hint, arrange, remedy)
+                self.assertTrue(after == OK or words_of(said) not in [w for _, _, w in way],
+                                f"{hint!r} leads back even after what it asks for:\n{shown}\n--- {hint}\n{said}")
+            elif code != OK or not path:
+                self.walk(hint, arrange, remedy, tuple(way))
+            else:
+                self.assertNotEqual(self.do(hint, arrange)[0], USAGE, shown)
+
+    def expect(self, arrange, commands, remedy=None, least=1):
+        """least: so many hints are met, so that a state without any is not taken for one whose hints are good."""
+        for command in commands:
+            self.walk(command, arrange, remedy)
+        self.assertGreaterEqual(len(self.walked) - len(commands), least, self.walked)
+
+    # ---- networks ---------------------------------------------------------------------------------
+
+    def test_no_gateway(self):
+        def arrange():
+            LAB.start_router()
+            sh("ip -n box route del default")
+            self.keep.append(back)
+        def back():
+            sh(f"ip -n box route replace default via {GATEWAY}", check=False)
+        self.expect(arrange, ("setup --yes", "detect", "save", "router show", "compat", "open 443"), back, 0)
+
+    def test_cable_out(self):
+        def arrange():
+            LAB.start_router()
+            sh("ip -n router link set box1 down")
+            self.keep.append(back)
+        def back():
+            sh("ip -n router link set box1 up")
+            wait_for(lambda: LAB.run("box", f"ping -c1 -W1 {GATEWAY}", check=False).returncode == 0, 10, "the cable is in")
+        self.expect(arrange, ("setup --yes", "detect", "status", "save"), back)
+
+    def test_no_internet(self):
+        def arrange():
+            LAB.start_router()
+            sh("ip -n router link set wan0 down")
+            self.keep.append(back)
+        def back():
+            sh("ip -n router link set wan0 up")
+        self.expect(arrange, ("setup --yes", "detect"), back, 0)
+
+    # ---- routers ----------------------------------------------------------------------------------
+
+    def test_router_of_an_unknown_model(self):
+        self.expect(LAB.start_router, ("setup", "detect", "detect --save", "save", "router show", "status", "rules list",
+                                       "service plan hoplink 80/tcp", "report", "test"), None, 5)
+
+    def test_router_that_fails_the_test(self):
+        self.expect(lambda: LAB.start_scripted("keeps_nothing"), ("setup --yes", "compat", "save"), LAB.stop_router, 3)
+
+    def test_router_that_the_database_does_not_trust(self):
+        def arrange():
+            LAB.start_scripted("none")
+            LAB.write(f"{CONF}/router_upnp.db", '[Lab/Scripted/7]\nsupport="no"\nmax="9"\n')
+        self.expect(arrange, ("setup", "detect --save"), None, 2)
+
+    def test_router_that_speaks_natpmp_only(self):
+        self.expect(lambda: LAB.start_router(upnp=False), ("setup", "detect", "compat", "save"), None, 2)
+
+    def test_router_with_everything_switched_off(self):
+        def described():
+            shutil.copytree(f"{homelab.HERE}/../../packaging/routerdb", "/etc.defaults/portforward/routerdb")
+        self.expect(described, ("setup", "detect", "compat"), LAB.start_router, 2)
+
+    def test_router_that_is_silent_after_it_was_known(self):
+        def arrange():
+            LAB.router_conf(False)
+            LAB.write(f"{CONF}/router_upnp.db", '[Lab/One/1]\nsupport="yes"\nmax="100"\n')
+            LAB.write(f"{CONF}/rule.conf", '[1]\nenabled="1"\nprotocol name="tcp"\nr_port="5001"\ns_port="5001"\n')
+        self.expect(arrange, ("setup", "status"), LAB.start_router, 0)
+
+    def test_router_that_is_driven_through_its_pages(self):
+        self.expect(lambda: LAB.start_web("form"), ("setup", "detect", "status", "save", "service plan hoplink 80/tcp"),
+                    LAB.start_router, 1)
+
+    def test_router_whose_pages_nobody_describes(self):
+        def arrange():
+            LAB.start_web("form")
+            shutil.rmtree("/etc.defaults/portforward/routerdb")
+        self.expect(arrange, ("setup", "save"), LAB.start_router, 1)
+
+    def test_router_that_is_full(self):
+        def arrange():
+            LAB.start_router()
+            LAB.write(f"{CONF}/router.conf", f'[{GATEWAY}]\nbrand="Lab"\nmodel="One"\nversion="1"\n'
+                      'support_router_upnp="yes"\nsupport_router_natpmp="no"\n')
+            LAB.write(f"{CONF}/router_upnp.db", '[Lab/One/1]\nsupport="yes"\nmax="1"\n')
+            LAB.write(f"{CONF}/rule.conf", "".join(
+                f'[{i}]\nenabled="1"\nprotocol name="tcp"\nr_port="{5000 + i}"\ns_port="5001"\n' for i in (1, 2)))
+        self.expect(arrange, ("save", "open 443"), None, 0)
+
+    # ---- settings ---------------------------------------------------------------------------------
+
+    def test_settings_of_another_router(self):
+        def arrange():
+            LAB.start_router()
+            LAB.write(f"{CONF}/router.conf", f'[{LAN2}]\nbrand="Lab"\nmodel="One"\nversion="1"\n'
+                      'support_router_upnp="yes"\nsupport_router_natpmp="no"\n')
+        self.expect(arrange, ("save", "router show", "status"), None, 2)
+
+    def test_settings_that_nobody_can_read(self):
+        def arrange():
+            LAB.start_router()
+            LAB.write(f"{CONF}/router.conf", "\0no settings\n")
+        self.expect(arrange, ("router show", "router set --upnp yes --brand X", "setup --yes", "save"), None, 2)
+
+    def test_settings_without_a_number_of_rules(self):
+        def arrange():
+            LAB.start_router()
+            LAB.router_conf(False)
+        self.expect(arrange, ("save", "router show", "service plan hoplink 80/tcp"), None, 2)
+
+    # ---- the box ------------------------------------------------------------------------------------
+
+    def test_edits_that_are_not_saved(self):
+        def arrange():
+            LAB.start_router()
+            run("setup --yes")
+            run("rules add web --router-port 443 --box-port 8443")
+        self.expect(arrange, ("status", "rules list", "rules remove 7"), None, 1)
+
+    def test_daemon_that_was_killed(self):
+        def arrange():
+            LAB.start_router()
+            run("setup --yes")
+            run("rules add web --router-port 443 --box-port 8443")
+            run("save")
+            LAB.stop_daemon(signal.SIGKILL)
+        self.expect(arrange, ("status", "rules list"), None, 0)
+
+    def test_another_operation(self):
+        def arrange():
+            LAB.start_router()
+            LAB.router_conf(False)
+            lock = open("/tmp/routerconf.lock", "w", encoding="utf-8")  # pylint: disable=consider-using-with
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            self.keep.append(lock.close)
+        self.expect(arrange, ("setup", "detect", "save", "compat", "router show"), None, 0)
+
+    # ---- the promise --------------------------------------------------------------------------------
+
+    def test_from_an_empty_machine_to_an_open_port_and_back(self):
+        LAB.start_router()
+        LAB.serve(8443)
+        self.clear()
+        LAB.start_router()
+        code, said = run("setup --yes")
+        self.assertEqual(code, OK, said)
+        self.assertRegex(said, "(?s)driven by +UPnP.*outside +198.41.0.4.*8443 +python3")
+        self.assertFalse(LAB.reaches("tcp", 443))
+        code, said = run("open 443 --to 8443")
+        self.assertEqual(code, OK, said)
+        self.assertTrue(LAB.reaches("tcp", 443))
+        code, said = run("close 443")
+        self.assertEqual(code, OK, said)
+        self.assertFalse(LAB.reaches("tcp", 443))
+        self.assertEqual(LAB.mappings(), {})
+        self.clear()
+        LAB.start_router()
+        code, said = run("open 443 --to 8443 --yes")  # the one command, from nothing
+        self.assertEqual(code, OK, said)
+        self.assertTrue(LAB.reaches("tcp", 443))
+
+
+class Rule(unittest.TestCase):
+    """The walk itself sees circles, wrong commands and what comes later."""
+
+    def test_extraction(self):
+        self.assertEqual(hints("see to it, then run 'tavoportmap setup'; 'tavoportmap compat' tests.\n"
+                               "  tavoportmap router set --brand BRAND \\\n      --upnp no    says it\n  - tavoportmap status\n"),
+                         [("setup", True), ("compat", False), ("router set --brand Alderman --upnp no", False),
+                          ("status", False)])
+
+    def test_the_walk_sees_what_is_wrong(self):
+        for told, wrong in (({"a": (1, "try 'tavoportmap b'"), "b": (1, "try 'tavoportmap a'")}, "a circle"),
+                            ({"a": (1, "try 'tavoportmap b'"), "b": (2, "there is no command 'b'")}, "no command"),
+                            ({"a": (1, "plug it in, then 'tavoportmap a'")}, "leads back"),
+                            ({"a": (1, "try 'tavoportmap b'"), "b": (0, "done")}, None)):
+            walker = Hints()
+            walker.setUp()
+            walker.do = lambda command, arrange, remedy=None, told=told: told[command]
+            if wrong:
+                self.assertRaisesRegex(AssertionError, wrong, walker.walk, "a", None, lambda: None)
+            else:
+                walker.walk("a", None, None)
+
+
+def prepare(lab):
+    global LAB, OUTSIDE
+    LAB, OUTSIDE = lab, networks.Outside(lab, avahi=False)
+
+
+if __name__ == "__main__":
+    homelab.run_tests(prepare)
