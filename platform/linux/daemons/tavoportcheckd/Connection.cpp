@@ -1,17 +1,18 @@
-// Reads a request, decides whether it is served, probes, answers. Relies on cpp-httplib's parser through a
-// stream of our own, as its sockets know neither a limit for the whole request nor one for its headers.
+// Reads a request, decides whether it is served, probes, answers. Relies on HttpRequest for HTTP.
 // Promises: see Connection.h.
 #include "daemons/tavoportcheckd/Connection.h"
 
-#include <httplib.h>
 #include <poll.h>
 #include <syslog.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <chrono>
-#include <cstring>
+#include <new>
+#include <optional>
+#include <string>
+#include <vector>
 
+#include "daemons/tavoportcheckd/HttpRequest.h"
 #include "daemons/tavoportcheckd/Prober.h"
 #include "porttest/Protocol.h"
 
@@ -19,21 +20,15 @@ namespace tavo {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-using std::chrono::milliseconds;
-
-constexpr milliseconds kReadLimit(5000);
-constexpr milliseconds kWriteLimit(5000);
-constexpr milliseconds kHoldTime(1000);
-constexpr size_t kMaxBody = 24U << 10U;
-constexpr size_t kMaxRequest = 32U << 10U;  // headers and body
-constexpr size_t kMaxHeaders = 40;
+constexpr std::chrono::milliseconds kHoldTime(1000);
 constexpr char kBearer[] = "Bearer ";
 enum Code {
     kOk = 200,
     kBadRequest = 400,
     kUnauthorized = 401,
     kNotFound = 404,
+    kLengthRequired = 411,
+    kTooLong = 413,
     kUnsupportedType = 415,
     kTooManyRequests = 429,
     kTooManyHeaders = 431,
@@ -41,64 +36,50 @@ enum Code {
     kBusy = 503
 };
 
-bool Wait(int fd, short nEvents, int fdStop, Clock::time_point end) {
-    const auto left = std::chrono::duration_cast<milliseconds>(end - Clock::now()).count();
-    pollfd rgWaiting[] = {{fd, nEvents, 0}, {fdStop, POLLIN, 0}};
-    return left > 0 && poll(rgWaiting, std::size(rgWaiting), static_cast<int>(left)) > 0 && rgWaiting[1].revents == 0 &&
-           rgWaiting[0].revents != 0;
+const char* Reason(Code enCode) {
+    switch (enCode) {
+        case kOk:
+            return "OK";
+        case kBadRequest:
+            return "Bad Request";
+        case kUnauthorized:
+            return "Unauthorized";
+        case kNotFound:
+            return "Not Found";
+        case kLengthRequired:
+            return "Length Required";
+        case kTooLong:
+            return "Content Too Large";
+        case kUnsupportedType:
+            return "Unsupported Media Type";
+        case kTooManyRequests:
+            return "Too Many Requests";
+        case kTooManyHeaders:
+            return "Request Header Fields Too Large";
+        case kInternal:
+            return "Internal Server Error";
+        case kBusy:
+            return "Service Unavailable";
+    }
+    return "";
 }
 
-// A client's socket with an end to its patience and to its appetite.
-class BoundedStream : public httplib::Stream {
-public:
-    BoundedStream(int fd, int fdStop) : mFd(fd), mFdStop(fdStop) {}
-
-    bool is_readable() const override { return true; }
-    bool is_writable() const override { return true; }
-    ssize_t read(char* pData, size_t nSize) override {
-        if (mSzBuffer.size() == mNTaken && !Fill()) {
-            return -1;
-        }
-        const size_t nTake = std::min(nSize, mSzBuffer.size() - mNTaken);
-        std::memcpy(pData, mSzBuffer.data() + mNTaken, nTake);
-        mNTaken += nTake;
-        return static_cast<ssize_t>(nTake);
+Code CodeOf(HttpFault enFault) {
+    switch (enFault) {
+        case HttpFault::kNone:
+            return kOk;
+        case HttpFault::kTooManyHeaders:
+            return kTooManyHeaders;
+        case HttpFault::kNoLength:
+            return kLengthRequired;
+        case HttpFault::kTooLong:
+            return kTooLong;
+        case HttpFault::kGone:
+        case HttpFault::kNoRequest:
+            break;
     }
-    ssize_t write(const char* pData, size_t nSize) override {
-        if (mWriteEnd == Clock::time_point()) {
-            mWriteEnd = Clock::now() + kWriteLimit;
-        }
-        for (;;) {
-            const ssize_t nSent = send(mFd, pData, nSize, MSG_NOSIGNAL | MSG_DONTWAIT);
-            if (nSent >= 0 || errno != EAGAIN || !Wait(mFd, POLLOUT, mFdStop, mWriteEnd)) {
-                return nSent;
-            }
-        }
-    }
-    void get_remote_ip_and_port(std::string&, int&) const override {}
-    void get_local_ip_and_port(std::string&, int&) const override {}
-    socket_t socket() const override { return mFd; }
-
-private:
-    bool Fill() {
-        mSzBuffer.resize(std::min<size_t>(mNAllowed, 4096));
-        mNTaken = 0;
-        const ssize_t nRead = mSzBuffer.empty() || !Wait(mFd, POLLIN, mFdStop, mReadEnd)
-                                  ? -1
-                                  : recv(mFd, mSzBuffer.data(), mSzBuffer.size(), MSG_DONTWAIT);
-        mSzBuffer.resize(static_cast<size_t>(std::max<ssize_t>(nRead, 0)));
-        mNAllowed -= mSzBuffer.size();
-        return nRead > 0;
-    }
-
-    int mFd;
-    int mFdStop;
-    Clock::time_point mReadEnd = Clock::now() + kReadLimit;
-    Clock::time_point mWriteEnd;
-    size_t mNAllowed = kMaxRequest;
-    std::string mSzBuffer;
-    size_t mNTaken = 0;
-};
+    return kBadRequest;
+}
 
 // Takes as long for a wrong text as for the right one; only the length may show.
 bool IsSame(const std::string& szOne, const std::string& szOther) {
@@ -188,119 +169,128 @@ std::string Answer(const Address& asker, const std::vector<CheckedPort>& rgPorts
     return FormatMessage(jsAnswer);
 }
 
-class Connection : private httplib::Server {
+struct Reply {
+    Code enCode;
+    std::string szBody;
+};
+
+Reply Refusal(Code enCode, const char* szWhy) {
+    Json::Value jsAnswer;
+    jsAnswer["error"] = szWhy;
+    return {enCode, FormatMessage(jsAnswer)};
+}
+
+class Connection {
 public:
-    Connection(const Address& peer, CheckdState& state);
+    Connection(const Address& peer, CheckdState& state) : mPeer(peer), mState(state) {}
     void Serve(int fd);
     bool HasHeld() const { return !mRgHeld.empty(); }
 
 private:
-    std::optional<Address> Asker(const httplib::Request& request) const;
-    Code Admit(const httplib::Request& request);
-    void Check(const std::string& szBody, httplib::Response& response);
-    static void Refuse(httplib::Response& response, Code enCode, const char* szWhy);
+    std::optional<Reply> Process(BoundedSocket& socket);
+    std::optional<Address> Asker() const;
+    Code Admit();
+    Reply Check();
+    void Send(BoundedSocket& socket, const Reply& reply) const;
 
     const Address& mPeer;
     CheckdState& mState;
+    HttpRequest mRequest;
     std::optional<Address> mAsker;
     std::optional<Turn> mTurn;
     std::vector<Descriptor> mRgHeld;
     std::string mSzNote;
 };
 
-Connection::Connection(const Address& peer, CheckdState& state) : mPeer(peer), mState(state) {
-    set_payload_max_length(kMaxBody);
-    // Before the body is read.
-    set_pre_routing_handler([this](const httplib::Request& request, httplib::Response& response) {
-        const Code enCode = Admit(request);
-        if (enCode == kOk) {
-            return HandlerResponse::Unhandled;
-        }
-        Refuse(response, enCode, "not served");
-        return HandlerResponse::Handled;
-    });
-    Post(kCheckPath,
-         [this](const httplib::Request& request, httplib::Response& response) { Check(request.body, response); });
-    set_exception_handler([](const httplib::Request&, httplib::Response& response, std::exception_ptr) {
-        Refuse(response, kInternal, "failed");
-    });
-    set_logger([this](const httplib::Request&, const httplib::Response& response) {
-        syslog(LOG_INFO, "%s: HTTP %d%s", (mAsker ? *mAsker : mPeer).Text().c_str(), response.status, mSzNote.c_str());
-    });
-}
-
-void Connection::Refuse(httplib::Response& response, Code enCode, const char* szWhy) {
-    Json::Value jsAnswer;
-    jsAnswer["error"] = szWhy;
-    response.status = enCode;
-    response.set_content(FormatMessage(jsAnswer), "application/json");
-    if (enCode == kTooManyRequests || enCode == kBusy) {
-        response.set_header("Retry-After", "60");
-    }
-}
-
 // Who asked: whoever is at the other end of the connection; only a trusted proxy is believed when it names
 // another. What it added itself comes last, after whatever its client sent.
-std::optional<Address> Connection::Asker(const httplib::Request& request) const {
+std::optional<Address> Connection::Asker() const {
     const std::vector<Address>& rgProxies = mState.config.rgTrustedProxies;
     if (std::find(rgProxies.begin(), rgProxies.end(), mPeer) == rgProxies.end()) {
         return mPeer;
     }
-    const size_t nHeaders = request.get_header_value_count(mState.config.szProxyHeader.c_str());
-    if (nHeaders == 0) {
+    const std::optional<std::string> szValue = mRequest.Header(mState.config.szProxyHeader);
+    if (!szValue) {
         return std::nullopt;
     }
-    const std::string szValue = request.get_header_value(mState.config.szProxyHeader.c_str(), nHeaders - 1);
-    const size_t nStart = szValue.find_last_of(", ") + 1;
-    const auto asker = Address::Parse(szValue.substr(nStart));
+    const auto asker = Address::Parse(szValue->substr(szValue->find_last_of(", ") + 1));
     return asker && asker->IsForeignHost() ? asker : std::nullopt;
 }
 
-Code Connection::Admit(const httplib::Request& request) {
-    if (request.headers.size() > kMaxHeaders) {
-        return kTooManyHeaders;
-    }
-    mAsker = Asker(request);
+// From the headers alone.
+Code Connection::Admit() {
+    mAsker = Asker();
     if (!mAsker) {
         return kBadRequest;
     }
     if (!mState.limits.Take(*mAsker)) {  // also for those who guess tokens
         return kTooManyRequests;
     }
-    if (request.method != "POST" || request.path != kCheckPath) {
+    if (mRequest.Method() != "POST" || mRequest.Path() != kCheckPath) {
         return kNotFound;
     }
-    if (!IsSame(request.get_header_value("Authorization"), kBearer + mState.config.szToken)) {
+    if (!IsSame(mRequest.Header("Authorization").value_or(""), kBearer + mState.config.szToken)) {
         return kUnauthorized;
     }
     // A packed body would grow beyond every bound as it is unpacked.
-    return request.get_header_value("Content-Type") == "application/json" && !request.has_header("Content-Encoding")
+    return mRequest.Header("Content-Type") == "application/json" && !mRequest.Header("Content-Encoding")
                ? kOk
                : kUnsupportedType;
 }
 
-void Connection::Check(const std::string& szBody, httplib::Response& response) {
+Reply Connection::Check() {
     CheckRequest request;
-    if (const char* szWrong = ReadRequest(szBody, mState.config.nMaxPorts, request)) {
-        Refuse(response, kBadRequest, szWrong);
-        return;
+    if (const char* szWrong = ReadRequest(mRequest.Body(), mState.config.nMaxPorts, request)) {
+        return Refusal(kBadRequest, szWrong);
     }
     if (!mTurn.emplace(mState.nUnderWay, mState.config.nAtOnce).IsOurs()) {
-        Refuse(response, kBusy, "busy");
-        return;
+        return Refusal(kBusy, "busy");
     }
     ProbeResult result = ProbePorts(*mAsker, request.rgPorts, request.szProbe, request.szAnswer, mState.fdStop);
     mRgHeld = std::move(result.rgHeld);
     const auto nOpen = std::count_if(result.rgFindings.begin(), result.rgFindings.end(),
                                      [](const PortFinding& finding) { return finding.enState == PortState::kOpen; });
     mSzNote = ", " + std::to_string(request.rgPorts.size()) + " ports, " + std::to_string(nOpen) + " open";
-    response.set_content(Answer(*mAsker, request.rgPorts, result.rgFindings), "application/json");
+    return {kOk, Answer(*mAsker, request.rgPorts, result.rgFindings)};
+}
+
+// Nothing for a client that left.
+std::optional<Reply> Connection::Process(BoundedSocket& socket) {
+    HttpFault enFault = mRequest.ReadHead(socket);
+    const Code enCode = enFault == HttpFault::kNone ? Admit() : CodeOf(enFault);
+    if (enFault != HttpFault::kGone && enCode != kOk) {
+        return Refusal(enCode, "not served");
+    }
+    enFault = enFault == HttpFault::kNone ? mRequest.ReadBody(socket) : enFault;
+    if (enFault == HttpFault::kGone) {
+        return std::nullopt;
+    }
+    return enFault == HttpFault::kNone ? Check() : Refusal(CodeOf(enFault), "not served");
+}
+
+void Connection::Send(BoundedSocket& socket, const Reply& reply) const {
+    std::string szText = "HTTP/1.1 " + std::to_string(reply.enCode) + ' ' + Reason(reply.enCode);
+    szText += "\r\nContent-Type: application/json\r\nContent-Length: " + std::to_string(reply.szBody.size());
+    szText += "\r\nConnection: close\r\n";
+    if (reply.enCode == kTooManyRequests || reply.enCode == kBusy) {
+        szText += "Retry-After: 60\r\n";
+    }
+    socket.Write(szText + "\r\n" + reply.szBody);
 }
 
 void Connection::Serve(int fd) {
-    BoundedStream stream(fd, mState.fdStop);
-    bool blClosed = false;
-    process_request(stream, true, blClosed, nullptr);
+    BoundedSocket socket(fd, mState.fdStop);
+    std::optional<Reply> reply;
+    try {
+        reply = Process(socket);
+    } catch (const std::bad_alloc&) {
+        reply = Refusal(kInternal, "failed");
+    }
+    if (reply) {
+        Send(socket, *reply);
+        syslog(LOG_INFO, "%s: HTTP %d%s", (mAsker ? *mAsker : mPeer).Text().c_str(), reply->enCode, mSzNote.c_str());
+        socket.Finish();
+    }
 }
 
 }  // namespace

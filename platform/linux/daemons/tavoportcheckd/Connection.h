@@ -1,5 +1,5 @@
-// One client of the port checker: one HTTP request, checked, served and answered. Relies on cpp-httplib for HTTP
-// alone; the socket, its clock and its bounds are ours. Promises: a client costs one thread for a bounded
+// One client of the port checker: one HTTP request, checked, served and answered. Relies on HttpRequest's bounds
+// and on Prober. Promises: a client costs one thread for a bounded
 // time and a bounded number of bytes, whatever it sends; nothing but its own address is ever connected to.
 #pragma once
 
