@@ -81,8 +81,15 @@ DBUS_CONF = f"""<busconfig>
 """
 
 
+class CommandFailed(RuntimeError):
+    """In the words of the command."""
+
+
 def sh(command, check=True, **kwargs):
-    return subprocess.run(command, shell=True, check=check, text=True, capture_output=True, **kwargs)
+    done = subprocess.run(command, shell=True, text=True, capture_output=True, **kwargs)
+    if check and done.returncode:
+        raise CommandFailed(f"{command}\n  ended with {done.returncode}: {(done.stderr or done.stdout).strip()}")
+    return done
 
 
 def wait_for(condition, seconds, what):
@@ -119,6 +126,15 @@ class Lab:
     def __init__(self):
         self.processes = []
         self.router = None
+        try:
+            self.wire()
+        except CommandFailed as failure:
+            sys.exit(f"The home network cannot be made. This failed: {failure}\nIt takes the kernel's veth, bridge and "
+                     "nf_tables, and in a container /proc and /sys as on a machine (with Docker: --privileged).")
+        self.install()
+
+    def wire(self):
+        """The hosts, their links and the router's packet filter."""
         for name in ("box", "lan2", "router", "wan"):
             sh(f"ip netns add {name} && ip -n {name} link set lo up")
         sh("ip -n router link add br0 type bridge && ip -n router link set br0 up")
@@ -132,7 +148,6 @@ class Lab:
            f"ip -n router link set wan0 up && ip -n wan addr add {WAN}/24 dev out0 && ip -n wan link set out0 up")
         self.run("router", "sysctl -qw net.ipv4.ip_forward=1")
         self.run("router", "nft -f -", input=NFT)
-        self.install()
 
     # ---- the box's files ------------------------------------------------------------------------
 

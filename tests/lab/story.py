@@ -1,7 +1,11 @@
 """The main job, shown: a box learns what its router is, the user's rules and a relay service's request go
 into a real router, and a stranger outside tries each port. Everything is said by the tool itself."""
 import os
+import shlex
+import subprocess
 import sys
+import tempfile
+import time
 
 import homelab
 import networks
@@ -12,6 +16,7 @@ CHECKD = f"{BUILD}/platform/linux/daemons/tavoportcheckd"
 TOKEN, CHECK_PORT = "0123456789abcdef-story", 8099
 FOREIGN = {("tcp", 5001): (LAN2, 5001), ("tcp", 9999): (LAN2, 9999)}
 PROBES = (("tcp", 8443), ("udp", 6001), ("tcp", 5000), ("tcp", 5001), ("udp", 6000))
+SILENCE = 5  # seconds, after which the demonstration says that it goes on
 SOME_STAY_OUT = 4  # the tool's exit status for it
 ROW = "  {:<10} {:<22} {:<24} {:<8} {}"
 
@@ -23,11 +28,19 @@ class Story:
 
     def tool(self, command):
         print(f"\n$ tavoportmap {command}", flush=True)
-        done = self.lab.run("box", f"{TOOL} {command}", check=False)
-        print("".join(f"  {line}\n" for line in done.stdout.splitlines()), end="")
-        if done.returncode:
-            print("".join(f"  {line}\n" for line in done.stderr.splitlines()), end="")
-        return done.returncode
+        start = time.monotonic()
+        with tempfile.TemporaryFile("w+") as out, tempfile.TemporaryFile("w+") as err:
+            running = self.lab.start("box", TOOL, *shlex.split(command), stdout=out, stderr=err)
+            while True:
+                try:
+                    running.wait(timeout=SILENCE)
+                    break
+                except subprocess.TimeoutExpired:
+                    print(f"  ... {time.monotonic() - start:.0f} s", flush=True)
+            for said in (out, err) if running.returncode else (out,):
+                said.seek(0)
+                print("".join(f"  {line}" for line in said), end="", flush=True)
+        return running.returncode
 
     def expect(self, command, status=0):
         if self.tool(command) != status:
