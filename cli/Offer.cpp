@@ -8,8 +8,11 @@
 #include <algorithm>
 #include <fstream>
 #include <iterator>
+#include <sstream>
 
+#include "Ask.h"
 #include "Listeners.h"
+#include "Open.h"
 #include "PortNames.h"
 #include "RuleStore.h"
 #include "Table.h"
@@ -91,9 +94,27 @@ Json::Value ToJson(const Listener& listener, const std::string& szRisk) {
     return js;
 }
 
+// The ports in the answer to the question; each is opened as by 'open', which asks back where that is risky.
+void OpenChosen(const std::string& szChosen, Reply& reply) {
+    std::istringstream words(szChosen);
+    std::vector<std::string> rgszWords{std::istream_iterator<std::string>(words), {}};
+    for (std::string& szWord : rgszWords) {
+        while (szWord.ends_with(',')) {
+            szWord.pop_back();
+        }
+        if (szWord.empty()) {
+            continue;
+        }
+        const Reply opened = OpenPort(szWord, false);
+        reply.szMessage += (reply.szMessage.empty() ? "" : "\n") + szWord + ": " + opened.szMessage;
+        reply.rgszWarnings.insert(reply.rgszWarnings.end(), opened.rgszWarnings.begin(), opened.rgszWarnings.end());
+        reply.enExit = opened.enExit == kOk ? reply.enExit : opened.enExit;
+    }
+}
+
 }  // namespace
 
-void OfferListeners(const std::string& szGateway, Reply& reply) {
+void OfferListeners(const std::string& szGateway, bool blAsk, Reply& reply) {
     const std::vector<Listener> rgFound = Candidates(szGateway);
     reply.jsAnswer["could_be_opened"] = Json::arrayValue;
     Table table({"port", "program", "remark"});
@@ -111,8 +132,18 @@ void OfferListeners(const std::string& szGateway, Reply& reply) {
         return;
     }
     reply.szBody += "\nlistens on this box and is not forwarded:\n" + table.ToText();
-    reply.szMessage += fmt::format("\n'tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
-                                   szSafe.empty() ? "a port" : "the first of them that is fit for it");
+    if (!blAsk) {
+        reply.szMessage += fmt::format("\n'tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
+                                       szSafe.empty() ? "a port" : "the first of them that is fit for it");
+        return;
+    }
+    // A question needs the result before it; whoever is asked has seen it then.
+    Print(reply, false);
+    reply.szBody.clear();
+    reply.szMessage.clear();
+    reply.rgszWarnings.clear();
+    OpenChosen(AskLine("Which of them are to be opened to everybody outside (such as 443 51820/udp; Enter: none)? "),
+               reply);
 }
 
 }  // namespace tavo::cli

@@ -7,7 +7,8 @@
 
 namespace tavo::cli {
 
-// Adds the programs that listen here, and the ports that containers publish, which no rule forwards yet.
-void OfferListeners(const std::string& szGateway, Reply& reply);
+// Adds the programs that listen here, and the ports that containers publish, which no rule forwards yet; where blAsk,
+// asks which of them to open and opens those.
+void OfferListeners(const std::string& szGateway, bool blAsk, Reply& reply);
 
 }  // namespace tavo::cli

@@ -9,6 +9,7 @@
 #include "Box.h"
 #include "Commands.h"
 #include "Listeners.h"
+#include "Open.h"
 #include "OpenPort.h"
 #include "PortNames.h"
 #include "Published.h"
@@ -239,6 +240,12 @@ Reply OpenPorts(const OpenWish& wish, bool blJson) {
 }
 
 }  // namespace
+
+Reply OpenPort(const std::string& szWhat, bool blJson) {
+    OpenWish wish;
+    wish.szWhat = szWhat;
+    return OpenPorts(wish, blJson);
+}
 
 void OfferOpen(CLI::App& app, Request& request) {
     const auto pWish = std::make_shared<OpenWish>();

@@ -210,7 +210,7 @@ Reply Finder::ByNatpmp() {
     mDetected.result.nMaxRule = blStored ? std::atoi(mBefore.conf.szMaxRule) : 0;
     Reply reply = Store(Way::kNatpmp, -1);
     if (mDetected.word.nNatpmp == TAVO_NET_NATPMP_OFFLINE) {
-        reply.rgszWarnings.emplace_back("the router says that it has no connection outside at the moment");
+        reply.rgszWarnings.emplace_back("the router says that it has no connection outside now");
     }
     return reply;
 }
@@ -290,7 +290,7 @@ Reply Setup(const SetupWish& wish, bool blJson) {
     }
     Reply reply = Finder(wish, blJson, *szGateway).Run();
     if (reply.enExit == kOk && wish.blOffer) {
-        OfferListeners(*szGateway, reply);
+        OfferListeners(*szGateway, !wish.blYes && !blJson && IsAnybodyThere(), reply);
     }
     return reply;
 }

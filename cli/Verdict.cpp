@@ -34,6 +34,10 @@ constexpr char kCarrier[] =
     "  - rent a small host elsewhere that passes connections on, or use a VPN that does";
 constexpr int kManyTranslations = 4;
 
+constexpr char kDescribed[] =
+    ". A router that is driven through its own pages must be described, under just this brand, model and version: "
+    "'tavoportmap routers' shows those that are";
+
 std::string NatWords(int nLevel) {
     if (nLevel < 0) {
         return "unknown";
@@ -151,7 +155,7 @@ Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, i
                            ? "the router's description is newer than the tool that carries it out; update the tool "
                              "(/usr/tavo/bin/tavoportforward). The old settings are still there"
                            : "the settings could not be stored; the old ones are still there, and the system log says "
-                             "why");
+                             "why" + std::string(blDaemon ? "" : kDescribed));
     }
     if (!blDaemon) {
         DropAccount();

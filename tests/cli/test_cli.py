@@ -500,12 +500,12 @@ class Tool(unittest.TestCase):
                  "(?s)did not take the test mappings.*newer firmware.*--trust-upnp.*routers BRAND", None),
                 ("", f"0 0 0 1 2 0 -1 {steps}", "1 -1", "-1 13 - - 0 10 20", FAILED, "no router answered", None),
                 ("", f"0 0 0 1 0 0 -1 {steps}", "1 0 198.51.100.7 1", "", OK, "driven by NAT-PMP", ("no", "yes")),
-                ("", f"0 0 0 1 0 0 -1 {steps}", "1 3", "", OK, "NAT-PMP(?s:.)*no connection outside at the moment|no connection "
-                 "outside at the moment(?s:.)*", ("no", "yes")),
+                ("", f"0 0 0 1 0 0 -1 {steps}", "1 3", "", OK, "driven by NAT-PMP(?s:.)*no connection outside now",
+                 ("no", "yes")),
                 ("", f"0 0 0 1 0 0 -1 {steps} able", "1 -1", "", FAILED, "(?s)use it all the same.*router set --brand 'Acme", None),
                 ("", f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "(?s)http://192.168.77.1/, then run 'tavoportmap setup' again", None),
                 (KNOWN % ("yes", "no"), f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "stored of it stays as it is", ("yes", "no")),
-                (pages, f"0 0 0 1 1 0 -1 {steps}", "1 -1", "", OK, "own pages(?s:.)*router set --upnp yes|router set --upnp yes(?s:.)*own pages", ("no", "no")),
+                (pages, f"0 0 0 1 1 0 -1 {steps}", "1 -1", "", OK, "own pages(?s:.)*router set --upnp yes", ("no", "no")),
                 ("\0\1 no settings", f"0 0 0 1 1 0 32 {steps}", "1 -1", "", OK, "kept as .*router.conf.unreadable", ("yes", "no")),
                 ("", "-1 3 0 0 0 0 -1 10 20 30 40", "0 -1", "", FAILED, "is the cable", None)):
             self.setUp()
@@ -516,8 +516,8 @@ class Tool(unittest.TestCase):
             self.expect("setup --yes", code, pattern, **world)
             words = tuple(re.findall(r'support_router_\w+="(\w+)"', get(ROUTER))) if os.path.exists(ROUTER) else None
             self.assertEqual(words, stored, (detected, word, tested))
-            if stored == ("yes", "no") and code == OK:
-                self.expect("setup", OK, "known now", **world)  # anew; what was recorded needs no second test
+            if " 1 1 0 " in detected and not before.startswith("["):
+                self.expect("setup", OK, "known now", **world)  # anew
         world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": f"0 0 0 1 2 0 -1 {steps}", "TAVO_COMPAT": passed}
         self.setUp()
         self.expect("setup", FAILED, "setup --yes +tests it and stores", **world)
