@@ -21,7 +21,7 @@ EVENT_LOG = "/var/log/tavo/event.log"
 WARNING, NOTICE = 28, 29  # of a daemon
 EVENTS = {"port-lost": (WARNING, "0x13100030", "Lost on the router"),
           "port-refused": (WARNING, "0x13100031", "Refused by the router"),
-          "port-back": (NOTICE, "0x13100032", "Open on the router again"),
+          "port-back": (NOTICE, "0x13100032", "Open on the router now"),
           "router-gone": (WARNING, "0x13100033", "The router is gone"),
           "router-back": (NOTICE, "0x13100034", "The router is back"),
           "router-replaced": (NOTICE, "0x13100035", "The router is another one"),

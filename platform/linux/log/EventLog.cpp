@@ -40,7 +40,7 @@ constexpr std::pair<unsigned, const char*> kCatalogue[] = {
     {TAVO_EVENT_PF_ADD_FAILED, "The router refused to forward these ports: "},
     {TAVO_EVENT_PF_PORT_LOST, "Lost on the router: "},
     {TAVO_EVENT_PF_PORT_REFUSED, "Refused by the router: "},
-    {TAVO_EVENT_PF_PORT_BACK, "Open on the router again: "},
+    {TAVO_EVENT_PF_PORT_BACK, "Open on the router now: "},
     {TAVO_EVENT_PF_ROUTER_GONE, "The router is gone: "},
     {TAVO_EVENT_PF_ROUTER_BACK, "The router is back: "},
     {TAVO_EVENT_PF_ROUTER_REPLACED, "The router is another one: "},

@@ -16,6 +16,7 @@ constexpr size_t kMostSingly = 8;    // ports with one and the same fate that ar
 constexpr size_t kMostListed = 512;  // bytes of a list of ports
 constexpr char kOften[] = " (it changes often, and is not told again for a while)";
 constexpr char kRouter[] = "router";
+constexpr char kReplaced[] = "replaced";
 constexpr char kOutside[] = "outside";
 constexpr char kRenewed[] = "renewed";
 
@@ -119,7 +120,7 @@ void Comparison::LookForAnother() {
                                    ? "its address is " + mNow.szGateway + ", before " + mTold.szGateway
                                    : "another device answers at " + mNow.szGateway + ", with the hardware address " +
                                          mNow.szHardware + ", before " + mTold.szHardware;
-    if ((blAddress || blDevice) && !Tell(kRouter, Change::kRouterReplaced, szText)) {
+    if ((blAddress || blDevice) && !Tell(kReplaced, Change::kRouterReplaced, szText)) {
         return;
     }
     mTold.szGateway = mNow.szGateway;

@@ -237,16 +237,16 @@ void RuleMapper::PublishPass(PassResult result, bool blRequested, int nSecondsTo
     state.szOutside = mSzOutside;
     state.nAt = std::time(nullptr);
     state.nNextLook = state.nAt + nSecondsToNext;
-    NoteSince(mTold.mTold, state);
+    NoteSince(mTold.Get(), state);
     Publish(state);
     TellNews(state, blRequested);
 }
 
 void RuleMapper::TellNews(const Published& state, bool blRequested) {
     if (!mWanted.blSwitchedOn) {
-        mTold.mTold = Told();         // whoever maps now tells what there is to tell
+        mTold.Get() = Told();         // whoever maps now tells what there is to tell
     } else if (state.blSwitchedOn) {  // a save switches it off for a moment
-        for (const Notice& notice : Compare(mTold.mTold, state, blRequested)) {
+        for (const Notice& notice : Compare(mTold.Get(), state, blRequested)) {
             mTeller.Tell(notice, state);
         }
     }
@@ -261,7 +261,7 @@ void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = Map({}, false, fnStop);
         if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
-            mTold.mTold.blWithdrawn = true;
+            mTold.Get().blWithdrawn = true;
             mTold.Save();
             return;
         }

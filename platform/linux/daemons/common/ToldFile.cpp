@@ -128,13 +128,17 @@ Told ParseTold(const std::string& szText) {
     return told;
 }
 
-void ToldFile::Load() {
-    mSzWritten = ReadFile(mSzPath).value_or("");
-    mTold = ParseTold(mSzWritten);
+Told& ToldFile::Get() {
+    if (!mBlRead) {
+        mSzWritten = ReadFile(mSzPath).value_or("");
+        mTold = ParseTold(mSzWritten);
+        mBlRead = true;
+    }
+    return mTold;
 }
 
 void ToldFile::Save() {
-    std::string szText = FormatTold(mTold);
+    std::string szText = FormatTold(Get());
     if (szText == mSzWritten) {
         return;
     }

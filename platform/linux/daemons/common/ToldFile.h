@@ -15,16 +15,16 @@ Told ParseTold(const std::string& szText);
 class ToldFile {
 public:
     // szDaemon: "upnpd", "natpmpd".
-    explicit ToldFile(const std::string& szDaemon) : mSzPath("/var/lib/tavo/" + szDaemon + ".told") { Load(); }
+    explicit ToldFile(const std::string& szDaemon) : mSzPath("/var/lib/tavo/" + szDaemon + ".told") {}
+    // Read when it is first asked for: until then another daemon, whose place this one takes, may write it.
+    Told& Get();
     void Save();
 
-    Told mTold;
-
 private:
-    void Load();
-
     std::string mSzPath;
     std::string mSzWritten;
+    bool mBlRead = false;
+    Told mTold;
 };
 
 }  // namespace tavo
