@@ -242,6 +242,10 @@ class RealRouter(Story):
                                       "02:00:00:00:00:99, before .*"), self.renewed)
 
     def test_the_daemon_is_killed(self):
+        pid = LAB.daemon_pid()
+        os.kill(pid, signal.SIGKILL)
+        wait_for(lambda: published()["pid"] not in (pid, 0) and row()["state"] == "open", 20, "it is back")
+        self.told()
         LAB.stop_daemon(signal.SIGKILL)
         self.assertEqual((row()["state"], LAB.daemon_pid()), ("open", 0))  # as it was when it last looked
         self.told()
