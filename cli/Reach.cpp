@@ -21,8 +21,7 @@ constexpr char kAdviceClosed[] =
     "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
 constexpr char kAdviceNoJudge[] =
     "whether a port is open can only be told from outside, by a port checker: tavoportcheckd on a host elsewhere, "
-    "named as url in [portcheck] of /etc/tavo/platform.conf. Where one is named it did not answer, or was asked too "
-    "much, or the port is a UDP port that a program has, whose protocol nobody knows";
+    "named as url in [portcheck] of /etc/tavo/platform.conf";
 
 std::string StatusWord(int enStatus) {
     constexpr const char* kWords[] = {"not tested", "disabled", "ok", "fail"};
@@ -39,6 +38,15 @@ std::vector<std::string> LoggedWords(const std::string& szLog) {
         rgszWords.push_back(szLog.substr(nWord, szLog.find('\n', nWord) - nWord));
     }
     return rgszWords;
+}
+
+// What the tester said of the rule at this place; empty when it said nothing.
+std::string LoggedReason(const std::string& szLog, size_t nRule) {
+    const std::string szBegin = fmt::format("port test, rule {}: ", nRule + 1);
+    const size_t nAt = szLog.rfind(szBegin);
+    return nAt == std::string::npos
+               ? ""
+               : Clean(szLog.substr(nAt + szBegin.size(), szLog.find('\n', nAt) - nAt - szBegin.size()));
 }
 
 std::string PortWords(const PortVerdict& verdict) {
@@ -67,10 +75,14 @@ void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) 
     // A log that does not fit the verdicts says nothing about any one of them.
     const bool blFits = rgszWords.size() == static_cast<size_t>(nUnjudged);
     size_t nWord = 0;
-    for (PortVerdict& verdict : rgVerdicts) {
+    for (size_t i = 0; i < rgVerdicts.size(); ++i) {
+        PortVerdict& verdict = rgVerdicts[i];
+        const std::string szLogged = LoggedReason(szLog, i);
         switch (verdict.enStatus) {
             case kNotTested:
-                verdict.szReason = blFits && rgszWords[nWord++] == "NOLISTEN" ? kNobodyListens : kNoJudge;
+                verdict.szReason = blFits && rgszWords[nWord++] == "NOLISTEN" ? kNobodyListens
+                                   : szLogged.empty()                         ? kNoJudge
+                                                                              : szLogged;
                 break;
             case kDisabled:
                 verdict.szReason = "the rule is switched off";
@@ -79,7 +91,7 @@ void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) 
                 verdict.szReason = "a connection from outside came through to this box";
                 break;
             case kClosed:
-                verdict.szReason = "refused, without an answer, or another host answers";
+                verdict.szReason = szLogged.empty() ? "refused, without an answer, or another host answers" : szLogged;
                 break;
             default:
                 verdict.szReason = "the tester gave no verdict that is known";
@@ -97,7 +109,7 @@ void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply) {
         reply.jsAnswer["ports"].append(ToJson(verdict));
         blClosed = blClosed || verdict.enStatus == kClosed;
         blUnjudged = blUnjudged || verdict.enStatus == kNotTested;
-        blNoJudge = blNoJudge || verdict.szReason == kNoJudge;
+        blNoJudge = blNoJudge || (verdict.enStatus == kNotTested && verdict.szReason != kNobodyListens);
     }
     reply.szBody += table.ToText();
     if (blNoJudge) {

@@ -2,13 +2,24 @@
  * libtavoportmap: finds out what the home router in front of the box is, keeps its settings and writes
  * the box's port-forwarding rules into it.
  *
- * The flat functions take plain records and can be called from C11 and C++; classes and what needs
- * references stand under __cplusplus. Every function runs on the caller's thread. Nothing is thrown:
- * flat functions answer 0 for success and -1 for failure unless their comment says otherwise, class
- * members 1 (true) and 0 (false); the reason of a failure is one line in the system log (priority
- * error). Records passed in belong to the caller and are only read or filled. Arrays and lists handed
- * out are malloc blocks of the caller's, released with the function named beside them. Texts are
- * NUL-terminated; a text that does not fit a field is cut.
+ * The flat functions take plain records and can be called from C11 and C++; classes and what needs references
+ * stand under __cplusplus. Nothing is thrown. Records passed in belong to the caller and are only read or filled.
+ * Arrays and lists handed out are malloc blocks of the caller's, released with the function named beside them.
+ * Texts are NUL-terminated; a text that does not fit a field is cut.
+ *
+ * Return values, by name:
+ *   0 done, -1 failed            TLib*, TestFunc*, DETECT_INFO::*, but for those below
+ *   1 done, 0 failed             class members (or true and false); GetGatewayIP, lock_file, SplitRouterName,
+ *                                IsGenericRouterName, PF_CONF::* (but for FreeArray), SetDetectManualCache;
+ *                                TLibGetRouterDBList, TLibFreeRouterDBList, TLibUpdateRouterDBList (-1: null argument)
+ *   an answer                    IsSavingRules (1 or 0), IGetCurrSyntaxVersion (a number or -1), TLibGetRouterConf
+ *                                (1: nothing stored), TLibTavoPortMapRulesSet, TLibTavoPortMapRouterDetect,
+ *                                TLibTestUpnpCompatibility (1 and 2, see there)
+ * Most failures leave one or more lines in the system log, all of priority error; so does some success.
+ *
+ * Calls run and call back on the caller's thread, one at a time: a process has one router lock, one UPnP client
+ * and one time limit. TLibTestRules has a thread of its own for its duration. TLibDetectRouter forks, and whatever
+ * runs a tool does. Most calls need root.
  */
 #ifndef LIBTAVOPORTMAP_H
 #define LIBTAVOPORTMAP_H
@@ -219,13 +230,14 @@ TAVO_API int TLibFreeRulesArr(__tag_TAVO_ROUTER_RULE* pRules);
 
 /* ---- locks and busy state ----------------------------------------------------------------------- */
 
-/* Takes the router lock for this process, without waiting. 0: taken; -1: held elsewhere. While it is
- * held, call the other functions with blLock false. */
+/* Takes the router lock for this process, without waiting. 0: taken; -1: held elsewhere, which is not logged.
+ * While it is held, call the other functions with blLock false, and none that takes the lock itself
+ * (TLibTavoPortMapRulesSet, TLibTavoPortMapRouterDetect, TLibUploadTestUpnpCompatibilityFailResult). */
 TAVO_API int TLibTavoPortMapLock(void);
 /* Gives it back; one unlock for one lock (a further one closes that descriptor number again, whatever it
  * is by then). Always 0. */
 TAVO_API int TLibTavoPortMapUnLock(void);
-/* What is running now, in any process. -1: null pointer. */
+/* What is running now, in any process; a detection does not show. -1: null pointer. */
 TAVO_API int TLibGetLibTavoPortMapRunningTask(__tag_TAVO_LIBTAVOPORTMAP_TASK* pEnTask);
 /* 1: rules are being written to the router; 0: not. */
 TAVO_API int IsSavingRules(void);
@@ -239,8 +251,9 @@ TAVO_API int TLibGetGatewayIP(char* szOutGatewayIP, int nSize);
 /* ---- rule files --------------------------------------------------------------------------------- */
 
 /* The rules of rule.conf (testrule.conf) as one array: *ppRules must be NULL on entry and is released
- * with TLibFreeRulesArr. szIdList: only these rules, NULL for all. An absent or empty file gives 0 rules
- * and NULL. pErr may be NULL; it is 2 when blLock asked for the router lock and it was held. */
+ * with TLibFreeRulesArr. szIdList: only these rules, NULL for all; -1 where no rule has one of the ids. An absent or
+ * empty file gives 0 rules and NULL. pErr may be NULL; it is 2 when blLock asked for the router lock and it was held.
+ * Each call that finds rules keeps some two kilobytes a rule for good: do not poll with it. */
 TAVO_API int TLibGetRulesArrFromRuleConf(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, char* szIdList, bool blLock,
                                          __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr);
 TAVO_API int TLibGetRulesArrFromTestRuleConf(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, char* szIdList,
@@ -251,12 +264,16 @@ TAVO_API int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRu
 
 /* ---- router description database ------------------------------------------------------------------ */
 
-/* These three answer -1 for a null argument, else 1 for success and 0 for failure. */
+/* These three answer -1 for a null argument, else 1 for success and 0 for failure. The list: also 1, and NULL, where
+ * no descriptions are installed. The update: also 1 where no server is named; *pnVersion is the edition that is
+ * installed then. */
 TAVO_API int TLibGetRouterDBList(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList);
 TAVO_API int TLibFreeRouterDBList(__tag_TAVO_ROUTERDB_LIST* plRouterDBList);
 TAVO_API int TLibUpdateRouterDBList(int* pnVersion);
-/* What the manual router behind szGwRouterIP can do. pErr may be NULL; it is 1 on every path (success
- * too), 2 when the lock was held. */
+/* Looks for what the router's own pages can do, and finds nothing: 0 with blSupportChangePort false for a router
+ * with UPnP or NAT-PMP and for one that is not stored; -1 for one that is driven through its pages (the section is
+ * looked for under an empty name, which is kept; RouterDB has the answer). pErr may be NULL; it is 1 on every path
+ * (success too), 2 when the lock was held. */
 TAVO_API int TLibGetRouterDesc(const char* szGwRouterIP, __tag_TAVO_ROUTER_DESC* routerDesc,
                                __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
 /* Rule syntax version of the installed port-forward tool; -1 when it tells none. */
@@ -266,7 +283,9 @@ TAVO_API int IGetCurrSyntaxVersion(void);
 
 /* The settings of the router behind szGwRouterIP; zero the record first: a field that is not stored, or
  * that this kind of router does not have, keeps what it held. 0: filled; 1: nothing is stored for this
- * gateway; -1: failed. pErr may be NULL: 0, or 2 when blLock asked for the router lock and it was held. */
+ * gateway; -1: failed, which may mean that only the limit is not known: all other fields are filled then. A
+ * router.conf that cannot be parsed is DELETED, with the account in it, and 1 is answered; the relay service's calls
+ * read through this one. pErr may be NULL: 0, or 2 when blLock asked for the router lock and it was held. */
 TAVO_API int TLibGetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerConf,
                                __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr, bool blLock);
 /* Makes the record the only section of router.conf, named by the current gateway. Account and connection
@@ -279,10 +298,14 @@ TAVO_API int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF*
 
 /* ---- detection ------------------------------------------------------------------------------------ */
 
-/* Finds out what the gateway is; takes several seconds. The callback is called on this thread after each
- * change of nProgress and once at the end, with NULL when detectResult is NULL. 0 or -1; detectResult has
- * the reason. One child process is forked; where that child cannot tell the gateway's address it returns
- * from this function with -1: a caller that must not be doubled compares its pid. */
+/* Finds out what the gateway is; takes several seconds, more where a download server is slow. The callback is called
+ * on this thread after each change of nProgress and once at the end, with NULL when detectResult is NULL; nProgress
+ * becomes 100 only after the last call. 0 or -1; errCode has the reason where it is one of its values, else it is 0
+ * and the log has it (interface down, no limit known, no child). On its way it deletes the detection cache, restarts
+ * avahi, and switches runupnpportmapping or runnatpmpportmapping of /etc/tavoinfo.conf off where the router
+ * does not answer by that protocol: the daemon then takes its mappings away at its next start or SIGHUP, and whoever
+ * does not store the result should put the keys back. One child process is forked; where that child cannot tell the
+ * gateway's address it returns from this function with -1: a caller that must not be doubled compares its pid. */
 TAVO_API int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* detectResult,
                               void (*pfnCallback)(const __tag_TAVO_ROUTER_DETECT_RESULT*, void*), void* arg,
                               bool blLock);
@@ -291,9 +314,13 @@ TAVO_API int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* detectRe
 
 /* ---- saving rules ------------------------------------------------------------------------------- */
 
-/* Makes rgRules the rule set of the box and writes it to the router; waits up to about five minutes.
- * saveResult may be NULL only without pfnCallback and without blLock. The callback is called on this
- * thread after each change of nProgress, never with a failure. */
+/* Makes rgRules the rule set of the box and writes it to the router: by UPnP, by NAT-PMP or through its own pages, as
+ * the FIRST section of router.conf says, whatever gateway that names; szGwRouterIP counts for the limits of pages
+ * only. Waits up to about five minutes; without rules, and with none that is on, not at all. Both run keys of
+ * /etc/tavoinfo.conf are off from the beginning until the daemon is started, and stay so after a failure: put them
+ * back where rule.conf was not changed. Through pages, what the router refused is not in the result but in
+ * /run/tavo/tavoportforward.json and the event log. saveResult may be NULL only without pfnCallback and without blLock.
+ * The callback is called on this thread after each change of nProgress, never with a failure. */
 TAVO_API int TLibSaveRules(const char* szGwRouterIP, int nRules, __tag_TAVO_ROUTER_RULE* rgRules, bool blLock,
                            __tag_TAVO_ROUTER_SAVE_RULE_RESULT* saveResult,
                            void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData);
@@ -333,19 +360,23 @@ TAVO_API int TestFuncSetRules(const char* szRequest);
 /* ---- router tests -------------------------------------------------------------------------------- */
 
 /* Whether the gateway's UPnP can be used: makes nMaxRule (at least 3) test mappings, counts, deletes and
- * makes them anew, and looks from outside whether the ports follow; takes minutes. 0: passed; 1: a step
- * failed, and testCompResult says "no"; -1: the test could not run (nStatus 2: locked; 13: no gateway that
- * speaks UPnP). The callback is called on this thread after each change of nProgress. */
+ * makes them anew, and looks whether the ports follow: from outside where a port checker is named, else by the
+ * router's table; takes minutes. 0: passed; 1: a step failed, and testCompResult says "no"; -1: the test could not
+ * run (nStatus 2: locked; 13: no gateway that speaks UPnP). A call that is refused, for a bad argument or because a
+ * test runs, ENDS the test that runs. The callback is called on this thread after each change of nProgress. */
 TAVO_API int TLibTestUpnpCompatibility(int nMaxRule, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* testCompResult,
                                        void (*pfnCallback)(const __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT*, void*),
                                        void* pData, bool blLock);
-/* Ends a test that runs, in any process, and deletes its files. Always 0. */
+/* Ends a test that runs, in any process, and deletes its files, also when none runs: with them upnpd's result file
+ * and /var/log/router.log. Always 0. */
 TAVO_API int TLibStopTestUpnpCompatibility(void);
 /* Keeps the outcome of a test as the user's own entry of the compatibility database, its only one. 0 or -1. */
 TAVO_API int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record);
-/* Sends the files of a failed test to the report server; the archive stays in /tmp. 0 or -1. */
+/* Sends the files of a failed test to the report server; the archive stays in /tmp. Takes the router lock itself; while
+ * it runs, router.conf holds other settings. 0 or -1. */
 TAVO_API int TLibUploadTestUpnpCompatibilityFailResult(void);
-/* Makes the port connection test ready; needed before each TLibTestRules after a compatibility test. 0 or -1. */
+/* Makes the port connection test ready; needed before the first TLibTestRules, and again after
+ * a compatibility test. 0 or -1. */
 TAVO_API int TLibTestRulesInit(void);
 /* Tests from outside whether the rules' ports reach the box and writes each rule's enTestStatus; -1 leaves
  * them as they were. err may be NULL: 0, or 2 when blLock asked for the router lock and it was held. */
@@ -362,8 +393,8 @@ TAVO_API int TLibParsePorts(std::list<int>& ports, const char* szPort);
 /* The same. */
 TAVO_API int TestFuncTLibParsePorts(std::list<int>& ports, char* szPort);
 /* Appends the outside ports that enabled mappings of other hosts hold on the UPnP router in front, which
- * it searches for at most 30 seconds. 0 (also without mappings), or -1: no router, no gateway, or no
- * address of the box's on its subnet. */
+ * it searches for at most 30 seconds. 0 (also without mappings, and where the table cannot be read), or -1: no router,
+ * no gateway, or no address of the box's on its subnet. */
 TAVO_API int TestFuncGetUsedRouterPortList(std::list<int>& tcpPorts, std::list<int>& udpPorts);
 } /* extern "C" */
 
@@ -378,7 +409,7 @@ TAVO_API bool SplitRouterName(char* szName, std::string& brand, std::string& mod
 /* Whether a router name carries no version. */
 TAVO_API bool IsGenericRouterName(bool& isGeneric, char* szName);
 
-/* Accessors of one parsed rule section. Every one answers 0 for a null or empty node. */
+/* Accessors of one parsed rule section. Every one answers 0 for a null node, and but for GetRuleID for an empty one. */
 namespace PF_CONF {
 TAVO_API int IsRuleEnable(bool& blEnable, const _tag_tavo_pf_conf* pConf);
 TAVO_API int GetRuleID(std::string& id, const _tag_tavo_pf_conf* pConf);
@@ -558,7 +589,8 @@ public:
     RouterUpnpDB(const std::string& brand, const std::string& model, const std::string& version);
     ~RouterUpnpDB();
 
-    /* False for an empty brand, model and version; fetches a missing database once. */
+    /* False for an empty brand, model and version. Fetches the downloaded database where its file is missing, at every
+     * call. */
     bool IsValid();
     /* "yes", "no" or "unknown". */
     bool GetSupport(std::string& support);
@@ -662,8 +694,8 @@ public:
     UpnpDetector();
     ~UpnpDetector();
 
-    /* One detection. True also when there is no UPnP; false: another detection runs, the result could not
-     * be stored, or the model has no name to look up. */
+    /* One detection. True also when there is no UPnP, which switches runupnpportmapping of /etc/tavoinfo.conf off;
+     * false: another detection runs, the result could not be stored, or the model has no name to look up. */
     bool Start();
     std::string GetStr(const std::string& key);
     std::string GetPfPath();
@@ -680,7 +712,8 @@ public:
     NatpmpDetector();
     ~NatpmpDetector();
 
-    /* One detection, about six seconds at most. True also when the gateway is no such router. */
+    /* One detection: restarts avahi, which may take up to 30 seconds, then about six seconds at most. True also when
+     * the gateway is no such router, which switches runnatpmpportmapping off. */
     bool Start(const char* szGatewayIP);
     std::string GetStr(const std::string& key);
     std::string GetVersion();
@@ -713,7 +746,8 @@ class TAVO_API NatpmpDaemon {
 public:
     bool IsAlive();
     bool Start();
-    /* The mappings that had to be given another port. Waits up to about 21 seconds. */
+    /* The mappings that were not made: another port was offered, refused, or not answered. Waits up to about 21
+     * seconds. */
     bool CheckDaemon(bool& blRemap, std::string& strRemap);
 };
 

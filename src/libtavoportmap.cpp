@@ -177,7 +177,7 @@ int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool
         LogError("%s:%d TAVOPFRuleGetByIdList() failed", kEntryFile, __LINE__);
         return -1;
     }
-    // The list stays with the platform's reader and is not released here.
+    // The list is never released: long-standing, and kept.
     if (PF_CONF::ToArray(*pnRules, ppRules, pList) == 0) {
         LogError("%s:%d PF_CONF::ToArray() failed", kEntryFile, __LINE__);
         return -1;

@@ -665,6 +665,9 @@ class Tool(unittest.TestCase):
             self.expect("test", code, "1 web +443/tcp to 8443", **environment)
         # The library itself, with no checker named anywhere.
         self.expect("test 2 3", FAILED, r"2 dns +53/udp +not tested(?s:.)*tavoportcheckd(?s:.)*\[portcheck\]")
+        put("/etc/tavo/platform.conf", '[portcheck]\nurl="http://127.0.0.1:1"\ntoken="0123456789abcdef"\n')
+        self.expect("test 2", FAILED, r"53/udp +not tested +53/udp: .*checker cannot be reached")
+        os.unlink("/etc/tavo/platform.conf")
         self.expect("test 7", USAGE, "there is no rule 7; the rules are 1, 2, 3")
 
     def test_a_report_says_what_it_lacks(self):

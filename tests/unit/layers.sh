@@ -9,7 +9,8 @@ forbid() { # FOLDER PATTERN REASON
         exit 1
     fi
 }
-forbid src '(core|portforward|porttest|net|upnp|task|daemons)/' "the library knows the platform by its seam only"
-forbid platform 'libtavoportmap' "the platform stands beneath the library"
-forbid cli '(core|portforward|porttest|net|upnp|task|daemons)/' "callers use the public header and the seam only"
-forbid include 'tavo/' "the public header stands alone"
+readonly szPlatform='([^>"]*/)?(core|portforward|porttest|net|upnp|natpmp|task|log|daemons)/'
+forbid src "$szPlatform" "the library knows the platform by its seam only"
+forbid platform '([^>"]*/)?libtavoportmap' "the platform stands beneath the library"
+forbid cli "$szPlatform" "callers use the public header and the seam only"
+forbid include '([^>"]*/)?tavo/' "the public header stands alone"

@@ -5,7 +5,8 @@
  * Text is NUL-terminated UTF-8. Every pointer handed out by an *Alloc or *Get function that returns
  * a container belongs to the caller, who gives it back with the matching *Free; a `const char*` read
  * out of a container stays valid until the container changes. Null arguments are bad input: the
- * functions answer with their failure value and record the reason as the last error.
+ * functions answer with their failure value, and those that can fail in more than one way record the reason as
+ * the last error.
  */
 #ifndef TAVO_CORE_H
 #define TAVO_CORE_H

@@ -1,6 +1,7 @@
 /*
  * Addresses, routes and interfaces of the box, and checks of the network that it is in. Texts are cut to
- * their field; no check needs root, starts a thread, changes anything or lasts longer than its bound.
+ * their field; no check needs root, starts a thread, changes the network or lasts longer than its bound. As root,
+ * getPublicIPLevel remembers where the router's UPnP was found (/var/lib/tavo/upnp_igd.conf).
  */
 #ifndef TAVO_NET_H
 #define TAVO_NET_H

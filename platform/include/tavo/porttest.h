@@ -23,7 +23,7 @@ enum { /* verdicts of one rule: of its ports the one that comes first in the ord
 };
 
 typedef struct tag_TAVO_PORT_STATUS {
-    char szText[1024]; /* why, for a user, with the ports: "5001/tcp: connection refused" */
+    char szText[1024]; /* why, with the ports: "5001/tcp: connection refused"; logged for each rule, too */
     int enStatus;
 } TAVO_PORT_STATUS;
 

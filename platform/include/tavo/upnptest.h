@@ -1,10 +1,10 @@
 /*
  * The UPnP compatibility test: operations that make and unmake test mappings on the gateway, and the
- * report of their progress. The mappings are of TCP ports that nobody has, neither a rule nor another host
- * nor a program of the box, and carry a description of their own; other mappings are never touched. The work
- * is done by upnpd in its test mode ("/usr/tavo/sbin/upnpd --debug -p"), which these calls start and direct;
- * it writes what became of each step into the progress file, "finished" or "failed". When a step fails, here
- * or there, it takes its mappings away and ends; so it does by SIGHUP, within three seconds, and when nobody
+ * report of their progress. The mappings are of TCP ports that nobody has, neither a rule (while upnpd
+ * is switched on) nor another host nor a program of the box, and carry a description of their own; other mappings are
+ * never touched. The work is done by upnpd in its test mode ("/usr/tavo/sbin/upnpd --debug -p"), which these calls
+ * start and direct; it writes what became of each step into the progress file, "finished" or "failed". When a step
+ * fails, here or there, it takes its mappings away and ends; so it does by SIGHUP, within ten seconds, and when nobody
  * directs it for three minutes. What happened stands in the router log.
  */
 #ifndef TAVO_UPNPTEST_H

@@ -1,6 +1,7 @@
 // The checks of the network that the box is in. Relies on the platform's addresses, and on Outside, Walk
 // and Level; the gateway is asked by NAT-PMP and by UPnP, in this order, because the first is the quicker.
-// Promises: no root, no thread; each check ends within seconds; nothing is changed anywhere.
+// Promises: no root, no thread; each check ends within seconds; nothing is changed, but that root remembers
+// where the router's UPnP was found.
 #include <arpa/inet.h>
 #include <net/if.h>
 #include <sys/ioctl.h>

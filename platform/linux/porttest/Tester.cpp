@@ -2,6 +2,7 @@
 // one for each rule. Relies on TestPorts. Promises: see tavo/porttest.h.
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -111,6 +112,8 @@ int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* r
             rgQuestions.empty() ? std::vector<PortVerdict>() : TestPorts(rgQuestions);
         for (size_t i = 0; i < rgParts.size(); ++i) {
             Fill(rgStatus[i], PutTogether(rgParts[i], rgQuestions, rgVerdicts));
+            // The library passes on the status alone; the reason is for whoever reads the log.
+            syslog(LOG_NOTICE, "port test, rule %zu: %s", i + 1, rgStatus[i].szText);
         }
         return 0;
     });
