@@ -2,6 +2,8 @@
 // Promises: takes no lock, changes no file, waits for nobody.
 #include <fmt/format.h>
 
+#include <algorithm>
+
 #include "Box.h"
 #include "Commands.h"
 #include "RuleStore.h"

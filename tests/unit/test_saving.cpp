@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+
 #include "libtavoportmap.h"
 #include "stage.h"
 #include "tavo/portforward.h"
