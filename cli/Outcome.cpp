@@ -63,6 +63,17 @@ size_t NotOpen(const Published& published) {
                                              [](const PublishedRule& r) { return r.enState != PortState::kOpen; }));
 }
 
+// What to do about ports that are not open.
+const char* Remedy(const Published& published) {
+    if (published.szProtocol == "pages" && published.szRouterWhy.find("password") != std::string::npos) {
+        return "'sudo tavoportmap router set --ask-password' stores another password, and '--user' another name";
+    }
+    if (published.szProtocol == "pages" && !published.szRouterWhy.empty()) {
+        return "'journalctl -t tavoportforward' says more; 'tavoportmap save' tries again";
+    }
+    return "Choose other router ports ('tavoportmap rules edit'), or free them there";
+}
+
 }  // namespace
 
 std::string Count(int64_t nCount, const std::string& szWhat) {
@@ -125,15 +136,15 @@ Reply OutcomeOf(const Published& published, const Rules& rules, const std::strin
     reply.enExit = nNot + nLeft > 0 ? kRefused : kOk;
     const std::string szOthers =
         nNot == published.rgRules.size() ? "and no other one is asked for" : "the others are in force";
-    reply.szMessage =
-        nNot > 0 ? fmt::format(
-                       "{} not open on the router; {}. Choose other router ports ('tavoportmap rules edit'), or "
-                       "free them there",
-                       Count(static_cast<int64_t>(nNot), "port"), szOthers)
-        : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; the daemon goes on trying",
-                                  Count(static_cast<int64_t>(nLeft), "port"))
-        : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
-                    : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
+    reply.szMessage = nNot > 0 ? fmt::format("{} not open on the router; {}. {}",
+                                             Count(static_cast<int64_t>(nNot), "port"), szOthers, Remedy(published))
+                      : nLeft > 0
+                          ? fmt::format("{} could not be taken away from the router yet; {}",
+                                        Count(static_cast<int64_t>(nLeft), "port"),
+                                        published.szProtocol == "pages" ? "the next 'tavoportmap save' tries again"
+                                                                        : "the daemon goes on trying")
+                      : nOn == 0 ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
+                                 : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
     return reply;
 }
 
