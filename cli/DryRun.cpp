@@ -24,19 +24,19 @@ constexpr size_t kAddressSize = 64;
 constexpr int kMostEntries = 65536;
 
 // The router's table by "443/tcp"; nothing where it cannot be read.
-struct Table {
+struct RouterTable {
     std::map<std::string, TAVO_UPNP_PORT_MAPPING> mapEntries;
     std::string szBox;
 };
 
-std::optional<Table> ReadTable(const StoredRouter& router, const std::string& szGateway) {
+std::optional<RouterTable> ReadTable(const StoredRouter& router, const std::string& szGateway) {
     char szBox[kAddressSize] = {};
     if (router.enWay != Way::kUpnp ||
         TAVONetLocalAddressGet(szGateway.c_str(), szBox, sizeof(szBox), nullptr, 0) != 0 ||
         TAVOUpnpInit(kSearchSeconds, kLocalPort) != 0) {
         return std::nullopt;
     }
-    Table table{.mapEntries = {}, .szBox = szBox};
+    RouterTable table{.mapEntries = {}, .szBox = szBox};
     TAVO_UPNP_PORT_MAPPING mapping = {};
     for (int i = 0; i < kMostEntries && TAVOUpnpPortMappingGet(i, &mapping) == 0; ++i) {
         const std::string szProtocol = mapping.szProtocol;
@@ -85,7 +85,7 @@ Wanted WantedBy(const Rules& rules) {
 }
 
 // Another device that the router's table gives this port to.
-std::string Holder(const std::optional<Table>& table, const std::string& szPort) {
+std::string Holder(const std::optional<RouterTable>& table, const std::string& szPort) {
     const auto it = table ? table->mapEntries.find(szPort) : decltype(table->mapEntries.end()){};
     if (!table || it == table->mapEntries.end() || it->second.szInternalClient == table->szBox) {
         return "";
@@ -96,7 +96,7 @@ std::string Holder(const std::optional<Table>& table, const std::string& szPort)
 }
 
 Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const Wanted& after,
-            const std::optional<Table>& table) {
+            const std::optional<RouterTable>& table) {
     const auto itBefore = before.mapPorts.find(key);
     const auto itAfter = after.mapPorts.find(key);
     if (itAfter == after.mapPorts.end()) {
@@ -130,7 +130,7 @@ void AddLine(const std::string& szProtocol, int nFirst, int nLast, const Fate& f
 
 // Neighbours with the same fate share a line; those that lead to other ports than their own are told one by one.
 // Whether any stays out.
-bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<Table>& table, Reply& reply) {
+bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<RouterTable>& table, Reply& reply) {
     std::map<std::pair<std::string, int>, Fate> mapFates;
     for (const auto* pWanted : {&before, &after}) {
         for (const auto& [key, nBox] : pWanted->mapPorts) {

@@ -14,6 +14,7 @@
 #include "PortPairs.h"
 #include "RuleImport.h"
 #include "RuleStore.h"
+#include "Table.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -129,16 +130,13 @@ Reply ChangeRule(const std::string& szWhich, bool blForce, const std::function<s
 
 // ---- list --------------------------------------------------------------------------------------------------
 
-std::string TableRow(const std::string& szId, const std::string& szState, const Rule& rule, const std::string& szNote) {
-    std::string szRow =
-        fmt::format("{:<4} {:<8} {:<6} {:<20} {:<20} {:<16} {}", Clean(szId), szState, Clean(rule.szProtocol),
-                    Clean(rule.szRouterPorts), Clean(rule.szBoxPorts), Clean(rule.szName), szNote);
-    szRow.erase(szRow.find_last_not_of(' ') + 1);
-    return szRow + "\n";
+std::vector<std::string> RowOf(const Rule& rule, const std::string& szState, const std::string& szEdit) {
+    return {rule.szId, szState, rule.szProtocol, rule.szRouterPorts, rule.szBoxPorts, rule.szName, szEdit};
 }
 
 // Adds what the draft changes; whether it changes anything.
 bool ListEdited(const Rules& inForce, const Rules& rules, Reply& reply) {
+    Table table({"id", "state", "proto", "router ports", "box ports", "name", ""});
     const std::vector<size_t> rgBefore = Fellows(rules, inForce);
     const std::vector<size_t> rgAfter = Fellows(inForce, rules);
     bool blEdited = false;
@@ -148,8 +146,8 @@ bool ListEdited(const Rules& inForce, const Rules& rules, Reply& reply) {
         const bool blNew = rgBefore[i] == std::string::npos;
         const std::string szChange = blNew ? "new" : IsSameContent(rules[i], inForce[rgBefore[i]]) ? "" : "changed";
         blEdited = blEdited || !szChange.empty();
-        reply.szBody += TableRow(rules[i].szId, rules[i].blEnabled ? "enabled" : "disabled", rules[i],
-                                 szChange.empty() ? "" : szChange + ", not saved");
+        table.Add(RowOf(rules[i], rules[i].blEnabled ? "enabled" : "disabled",
+                        szChange.empty() ? "" : szChange + ", not saved"));
         Json::Value js = ToJson(rules[i]);
         js["change"] = szChange.empty() ? Json::Value() : Json::Value(szChange);
         reply.jsAnswer["rules"].append(js);
@@ -157,10 +155,11 @@ bool ListEdited(const Rules& inForce, const Rules& rules, Reply& reply) {
     for (size_t i = 0; i < inForce.size(); ++i) {
         if (rgAfter[i] == std::string::npos) {
             blEdited = true;
-            reply.szBody += TableRow(inForce[i].szId, "removed", inForce[i], "not saved");
+            table.Add(RowOf(inForce[i], "removed", "not saved"));
             reply.jsAnswer["removed"].append(ToJson(inForce[i]));
         }
     }
+    reply.szBody = table.ToText();
     return blEdited;
 }
 
@@ -171,9 +170,6 @@ Reply ListRules() {
         return NeedsRoot().value_or(Unreadable());
     }
     Reply reply;
-    const Rule head{"", true, "proto", "router ports", "box ports", "", "name"};
-    reply.szBody =
-        rules->empty() && inForce->empty() ? "" : Paint(Ink::kBold, TableRow("id", "state", head, ""), STDOUT_FILENO);
     const bool blEdited = ListEdited(*inForce, *rules, reply);
     reply.jsAnswer["draft"] = blEdited;
     reply.jsAnswer["off"] = IsOff();
