@@ -26,7 +26,7 @@ class Case(unittest.TestCase):
             LAB.end(LAB.router)
         LAB.clear_state(*STATE)
 
-    def tool(self, command, code=OK, pattern=""):
+    def tool(self, command, code=OK, pattern="."):
         run = LAB.run("box", f"{TOOL} {command}", check=False)
         self.assertEqual(run.returncode, code, f"{command}: {run.stdout}{run.stderr}")
         self.assertRegex(run.stdout + run.stderr, pattern, command)
@@ -75,7 +75,7 @@ class RealRouter(Case):
                 LAB.stop_daemon(signal.SIGTERM)
                 self.restart()
                 wait_for(lambda: ("tcp", 5001) in self.open_ports(), 10, "what is in force is open")
-                self.assertEqual(self.open_ports(), {("tcp", 5001): 5001})
+                self.assertNotIn(("tcp", 5002), self.open_ports(), "the edit waits")
         self.tool("save --dry-run", OK, r"keep +5001/tcp(?s:.)*open +5002/tcp|open +5002/tcp(?s:.)*keep +5001/tcp")
         self.tool("save", OK, "2 rules in force")
         self.assertEqual(self.open_ports(), {("tcp", 5001): 5001, ("tcp", 5002): 5002})
@@ -113,14 +113,16 @@ class NoGoodRouter(Case):
                 ("no UPnP", None, "true", "is there, but does not offer UPnP(?s:.)*switch UPnP on"),
                 ("unplugged", "none", "ip -n router link set box1 down", "cannot be reached(?s:.)*cable")):
             with self.subTest(name):
-                if fault:
-                    LAB.start_scripted(fault)
-                homelab.sh(cut)
-                self.tool("rules add --router-port 5001")
-                self.tool("save", AWAY, f"{pattern}(?s:.)*tavoportmap status")
-                homelab.sh("ip -n router link set box1 up")
-                self.tearDown()
-                self.setUp()
+                try:
+                    if fault:
+                        LAB.start_scripted(fault)
+                    homelab.sh(cut)
+                    self.tool("rules add --router-port 5001")
+                    self.tool("save", AWAY, f"{pattern}(?s:.)*tavoportmap status")
+                finally:
+                    homelab.sh("ip -n router link set box1 up")
+                    self.tearDown()
+                    self.setUp()
 
     def test_what_stays_on_the_router_is_not_called_gone(self):
         LAB.start_scripted("gives_nothing_back")
