@@ -25,12 +25,17 @@ struct Place {
     std::vector<Word> rgWords;
 };
 
-// One line, safe inside a shell's single quotes and in a list that ":" divides.
-std::string Description(const std::string& szText) {
-    std::string szLine = szText.substr(0, szText.find('\n'));
-    std::erase_if(szLine, [](char c) { return c == '\'' || c == '\\' || c == '[' || c == ']'; });
-    std::replace(szLine.begin(), szLine.end(), ':', ',');
-    return szLine;
+std::string FirstLine(const std::string& szText) {
+    return szText.substr(0, szText.find('\n'));
+}
+
+// For the inside of single quotes. A quotation mark is written in another way by each shell.
+std::string Quoted(const std::string& szText, std::string_view szMark) {
+    std::string szQuoted;
+    for (const char c : szText) {
+        szQuoted += c == '\'' ? std::string(szMark) : std::string(1, c);
+    }
+    return szQuoted;
 }
 
 void Collect(const CLI::App& app, const std::string& szPath, std::vector<Place>& rgPlaces) {
@@ -38,13 +43,13 @@ void Collect(const CLI::App& app, const std::string& szPath, std::vector<Place>&
     std::vector<const CLI::App*> rgShown =
         app.get_subcommands([](const CLI::App* pApp) { return !pApp->get_group().empty(); });
     for (const CLI::App* pCommand : rgShown) {
-        place.rgWords.push_back({pCommand->get_name(), Description(pCommand->get_description())});
+        place.rgWords.push_back({pCommand->get_name(), FirstLine(pCommand->get_description())});
     }
     for (const CLI::App* pApp = &app; pApp != nullptr; pApp = pApp->get_parent()) {
         for (const CLI::Option* pOption : pApp->get_options()) {
             for (const std::string& szName : pOption->get_lnames()) {
                 place.rgWords.push_back(
-                    {"--" + szName, Description(pOption->get_description()), pOption->get_items_expected_max() > 0});
+                    {"--" + szName, FirstLine(pOption->get_description()), pOption->get_items_expected_max() > 0});
             }
         }
     }
@@ -146,7 +151,7 @@ std::string ForZsh(const std::vector<Place>& rgPlaces) {
         for (const Word& word : place.rgWords) {
             szWords += fmt::format("{}{}:{}", szWords.empty() ? "" : "\n", word.szText, word.szWhat);
         }
-        szLines += fmt::format("        '.{}' '{}'\n", place.szPath, szWords);
+        szLines += fmt::format("        '.{}' '{}'\n", place.szPath, Quoted(szWords, R"('\'')"));
     }
     return fmt::format(kZsh, szLines, Values(rgPlaces, "        '{}' 1\n"));
 }
@@ -160,7 +165,7 @@ std::string ForFish(const std::vector<Place>& rgPlaces) {
             const bool blOption = word.szText.starts_with("--");
             szLines += fmt::format("complete -c tavoportmap -n \"__tavoportmap_at '.{}'\" {} {}{} -d '{}'\n",
                                    place.szPath, blOption ? "-l" : "-a", blOption ? word.szText.substr(2) : word.szText,
-                                   word.blValue ? " -r -F" : "", word.szWhat);
+                                   word.blValue ? " -r -F" : "", Quoted(word.szWhat, R"(\')"));
         }
     }
     return fmt::format(kFish, szNames, szLines);
