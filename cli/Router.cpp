@@ -6,6 +6,7 @@
 #include "Account.h"
 #include "Box.h"
 #include "Commands.h"
+#include "RouterTable.h"
 #include "Secret.h"
 #include "Settings.h"
 #include "Usage.h"
@@ -210,13 +211,14 @@ void OfferSet(CLI::App& router, Request& request) {
 }  // namespace
 
 void OfferRouter(CLI::App& app, Request& request) {
-    CLI::App* pRouter = AddCommand(app, "router", "the stored settings of the router: show, set");
+    CLI::App* pRouter = AddCommand(app, "router", "the router: its stored settings (show, set), its table");
     pRouter->require_subcommand(1);
     const auto pShowPassword = std::make_shared<bool>(false);
     CLI::App* pShow = AddCommand(*pRouter, "show", "what is stored for the current gateway");
     pShow->add_flag("--show-password", *pShowPassword, "show the password, too");
     pShow->callback(
         [pShowPassword, &request] { request.fnCommand = [pShowPassword] { return Show(*pShowPassword); }; });
+    OfferRouterTable(*pRouter, request);
     OfferSet(*pRouter, request);
 }
 

@@ -1,8 +1,11 @@
 // tavoportmap: the port-forwarding rules of this box and the router that they go to, for people and scripts.
 // Relies on the library's public header; CLI11 reads the arguments, fmt and jsoncpp write the answers.
 // Promises: one answer, also to wrong arguments; exit codes as in --help.
+#include <algorithm>
 #include <exception>
+#include <iterator>
 #include <string_view>
+#include <utility>
 
 #include "Commands.h"
 #include "Setup.h"
@@ -15,14 +18,32 @@ namespace {
 
 constexpr char kFooter[] =
     "First steps:\n"
-    "  tavoportmap setup              find out what the router is and remember it\n"
-    "  tavoportmap rules add web --router-port 443 --box-port 8443\n"
-    "  tavoportmap save               write the rules to the router\n\n"
-    "Exit codes: 0 done, 1 failed, 2 wrong arguments, 3 another operation is running,\n"
-    "4 some ports were refused or are closed, 5 more rules than the router holds.\n\n"
-    "With --json every answer, also to wrong arguments, is one JSON document on\n"
-    "standard output: \"ok\", \"message\", \"warnings\" and what the command has to say.\n"
-    "Files, the meaning of each status and what to do: man tavoportmap\n";
+    "  sudo tavoportmap setup               find out how the router opens ports\n"
+    "  sudo tavoportmap open 443 --to 8443  open port 443 of the router, for port 8443 of this box\n"
+    "  tavoportmap status                   whether it is open, and if not, why\n\n"
+    "Exit codes: 0 done; 1 failed; 2 wrong arguments; 3 another operation is running; 4 some ports were refused, are "
+    "closed or not in force; 5 more rules than the router holds; 6 nothing is kept, because the router, the network or "
+    "the daemon is away.\n\n"
+    "With --json every answer, also to wrong arguments, is one JSON document on standard output: \"ok\", \"message\", "
+    "\"warnings\" and what the command has to say. All of it: man tavoportmap\n";
+
+// Under which head of the help a command stands; in the order of the heads, what a newcomer needs first.
+constexpr std::pair<const char*, const char*> kGroups[] = {{"setup", "Ports"},
+                                                           {"open", "Ports"},
+                                                           {"close", "Ports"},
+                                                           {"off", "Ports"},
+                                                           {"on", "Ports"},
+                                                           {"status", "Ports"},
+                                                           {"test", "Ports"},
+                                                           {"rules", "Rules in detail"},
+                                                           {"save", "Rules in detail"},
+                                                           {"service", "Rules in detail"},
+                                                           {"router", "The router"},
+                                                           {"routers", "The router"},
+                                                           {"detect", "The router"},
+                                                           {"compat", "The router"},
+                                                           {"report", "The router"}};
+constexpr char kOtherGroup[] = "For scripts and developers";
 
 constexpr size_t kHelpColumn = 24;  // where the explanations of a help text begin
 
@@ -33,6 +54,14 @@ bool AsksForJson(int argc, char** argv) {
         }
     }
     return false;
+}
+
+void Group(CLI::App& app) {
+    for (CLI::App* pCommand : app.get_subcommands([](const CLI::App*) { return true; })) {
+        const auto pGroup = std::find_if(std::begin(kGroups), std::end(kGroups),
+                                         [&](const auto& group) { return pCommand->get_name() == group.first; });
+        pCommand->group(pGroup == std::end(kGroups) ? kOtherGroup : pGroup->second);
+    }
 }
 
 // The help of the command that the arguments name.
@@ -53,18 +82,19 @@ Reply Answer(int argc, char** argv, Request& request) {
     OfferSetup(app, request);
     OfferOpen(app, request);
     OfferClose(app, request);
-    OfferDetect(app, request);
-    OfferRouter(app, request);
-    OfferRouters(app, request);
+    OfferStatus(app, request);
+    OfferTest(app, request);
     OfferRules(app, request);
     OfferSave(app, request);
-    OfferTest(app, request);
-    OfferStatus(app, request);
+    OfferService(app, request);
+    OfferRouter(app, request);
+    OfferRouters(app, request);
+    OfferDetect(app, request);
     OfferCompat(app, request);
     OfferReport(app, request);
-    OfferService(app, request);
     OfferDiag(app, request);
     OfferCompletions(app, request);
+    Group(app);
     try {
         app.parse(argc, argv);
     } catch (const CLI::CallForHelp&) {

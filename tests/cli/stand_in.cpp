@@ -2,9 +2,9 @@
 // status limit limit2" or "result status ports", "write" at the end: the rules are stored), TAVO_DETECT ("result error
 // flags level upnp natpmp max percent...", "child" at the end: the forked process returns, too), TAVO_COMPAT ("result
 // status brand support max percent...", "hang" at the end), TAVO_REACH (statuses; 0 with the word that is logged),
-// TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53", other hosts' mappings), TAVO_WORD ("there
-// natpmp outside kind", the gateway's own word), TAVO_UID (who asks). Promises: calls back and logs as the library
-// does.
+// TAVO_LAST ("upnp brand", the last detection), TAVO_USED ("TCP:5000 UDP:53@192.168.77.2:53", the router's table: of
+// another host where none is named), TAVO_WORD ("there natpmp outside kind", the gateway's own word), TAVO_UID (who
+// asks). Promises: calls back and logs as the library does.
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <syslog.h>
@@ -190,17 +190,28 @@ int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
     std::string szItem;
     for (int i = 0; i <= nIndex; ++i) {
         if (!(wanted >> szItem)) {
-            return 1;
+            return 713;
         }
     }
     *pMapping = {};
     std::snprintf(pMapping->szProtocol, sizeof(pMapping->szProtocol), "%s", szItem.substr(0, 3).c_str());
     std::snprintf(pMapping->szInternalClient, sizeof(pMapping->szInternalClient), "192.168.77.99");
+    std::snprintf(pMapping->szDescription, sizeof(pMapping->szDescription), "console\x1b[2J");
     pMapping->nExternalPort = std::atoi(szItem.c_str() + 4);
+    if (const size_t nHost = szItem.find('@'); nHost != std::string::npos) {
+        const size_t nPort = szItem.find(':', nHost);
+        szItem.substr(nHost + 1, nPort - nHost - 1).copy(pMapping->szInternalClient, sizeof(pMapping->szInternalClient) - 1);
+        pMapping->szInternalClient[nPort - nHost - 1] = '\0';
+        pMapping->nInternalPort = std::atoi(szItem.c_str() + nPort + 1);
+    }
     pMapping->nEnabled = 1;
     return 0;
 }
 
 int TAVOUpnpPortMappingFind(int, const char*, TAVO_UPNP_PORT_MAPPING*) {
     return 0;
+}
+
+int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL*) {
+    return -1;
 }

@@ -14,6 +14,7 @@ import shutil
 import signal
 import socket
 import subprocess
+import time
 import unittest
 
 BUILD = os.environ["TAVO_BUILD_DIR"]
@@ -138,7 +139,7 @@ class Tool(unittest.TestCase):
 
     def test_help_and_man_page_know_every_command_and_option(self):
         page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
-        for command in ("", "setup", "detect", "router show", "router set", "routers", "rules list", "rules add", "rules remove",
+        for command in ("", "setup", "detect", "router show", "router set", "router table", "routers", "rules list", "rules add", "rules remove",
                         "rules enable", "rules disable", "rules edit", "rules discard", "rules import", "rules export",
                         "open", "close", "off", "on", "save", "status", "compat", "test", "report", "diag", "diag parse-ports",
                         "diag to-ports", "diag rules", "diag used-ports", "diag conflicts", "diag test", "diag set",
@@ -187,7 +188,7 @@ class Tool(unittest.TestCase):
             for arguments in ("rules add --router-port 80", "rules list", "rules remove 1", "save"):
                 self.expect(arguments, FAILED, "cannot be read as rules; it was left as it is")
             self.assertEqual(get(RULES), text)
-            self.expect("status", OK, "rules +unreadable")
+            self.expect("status", FAILED, "rules +unreadable")
 
     def test_hostile_texts_do_not_reach_the_terminal(self):
         name = "\x1b[2Jx\r\n\u202eevil\u009b31m\x7f"
@@ -235,7 +236,7 @@ class Tool(unittest.TestCase):
             for arguments in ("rules add --router-port 81", "rules remove 1", "save", "router show",
                               "router set --upnp no --natpmp yes", "detect", "open 81", "close 80", "off", "rules discard"):
                 self.expect(arguments, BUSY, "another port-forwarding operation is running")
-            self.expect("status", OK, "rules +1")
+            self.expect("status", AWAY, "rules +1(?s:.)*running now +an operation that holds the router lock \\(python3\\)")
             self.assertEqual(self.json("save")[1]["status"], 2)
         self.expect("rules remove 1", OK, "noted")
 
@@ -706,6 +707,174 @@ class Tool(unittest.TestCase):
                 ("diag set hoplink;5000;tcp", OK, r"router_ports \[5000\]=not test\n")):
             self.expect(arguments, code, pattern)
         self.assertEqual(self.json("diag", "to-ports", "1,2")[1]["output"], "1-2\n")
+
+    # ---- status ---------------------------------------------------------------------------------
+
+    def keep(self, on="upnp", alive=True):
+        """Rules of one, two and no ports, the run key, and a process that counts as the daemon."""
+        self.store((1, "tcp", "443", "8443", "web"), (1, "all", "53,5000-5001", "53,5000-5001", ""), (0, "tcp", "9", "9", "x"))
+        put("/etc/tavoinfo.conf", f'runupnpportmapping="{"yes" if on == "upnp" else "no"}"\n'
+                                  f'runnatpmpportmapping="{"yes" if on == "natpmp" else "no"}"\n')
+        put(ROUTER, KNOWN % ("yes", "no"))
+        shutil.rmtree("/run/tavo", ignore_errors=True)
+        os.makedirs("/run/tavo")
+        if alive:
+            daemon = subprocess.Popen([on + "d"], executable="/usr/bin/python3", stdin=subprocess.PIPE)
+            self.addCleanup(lambda: (daemon.kill(), daemon.wait(), daemon.stdin.close()))
+            return daemon.pid
+        return 0
+
+    def publish(self, pid, *refused, name="upnpd", **members):
+        """All ports of those rules open, but for those named: (port, protocol, members)."""
+        now = int(time.time())
+        rows = [{"name": f"{port}/{protocol}", "router_port": port, "box_port": box, "protocol": protocol, "rule": rule,
+                 "state": "open", "word": "1", "why": None, "holder": None, "since": now, "until": now + 3600}
+                for port, box, protocol, rule in ((443, 8443, "tcp", "web"), (53, 53, "tcp", "8"), (53, 53, "udp", "8"),
+                                                  (5000, 5000, "tcp", "8"), (5001, 5001, "tcp", "8"),
+                                                  (5000, 5000, "udp", "8"), (5001, 5001, "udp", "8"))]
+        for port, protocol, changes in refused:
+            next(row for row in rows if (row["router_port"], row["protocol"]) == (port, protocol)).update(changes)
+        put("/run/tavo/next", json.dumps({"protocol": "UPnP", "pid": pid, "at": now, "switched_on": True, "gateway": GATEWAY,
+                                          "box": "192.168.77.2", "outside": "198.41.0.4", "router": "ok", "router_why": None,
+                                          "router_since": now, "next_look": now + 120, "rules": rows, "left_over": [],
+                                          **members}))
+        os.rename("/run/tavo/next", f"/run/tavo/{name}.json")
+
+    def standing(self, **environment):
+        code, told = self.json("status", **environment)
+        return code, told["standing"], [rule["state"] for rule in told["rules"]]
+
+    def test_status_says_what_is_kept_and_what_keeps_it_from_being(self):
+        shutil.rmtree("/run/tavo", ignore_errors=True)
+        put("/etc/tavoinfo.conf", "")
+        self.expect("status", OK, "kept by +nobody(?s:.)*tavoportmap open 443")
+        self.keep(on="none", alive=False)
+        self.expect("status", AWAY, "web +443/tcp to 8443 +not kept +mapping is switched off(?s:.)*'sudo tavoportmap save'")
+        os.unlink(ROUTER)
+        self.expect("status", AWAY, "nobody knows the router yet(?s:.)*'sudo tavoportmap setup'")
+        self.keep(alive=False)
+        self.expect("status", AWAY, "not kept +upnpd does not run\n(?s:.)*'sudo tavoportmap save' starts it")
+        pid = self.keep()
+        self.expect("status", FAILED, "unknown +upnpd has not said anything of it yet(?s:.)*look again")
+        self.publish(pid)
+        self.assertEqual(self.standing(), (OK, "in_force", ["open", "open", "off"]))
+        self.expect("status", OK, "outside address +198.41.0.4\n(?s:.)*last look +.* s ago, next(?s:.)*all 2 rules are in force\n$")
+        console = {"state": "refused", "word": "718", "why": "another device has this port on the router",
+                   "holder": {"address": "192.168.77.7", "description": "console\x1b[2J"}}
+        self.publish(pid, (443, "tcp", console), (5001, "udp", {"state": "waiting", "why": "taken", "until": 0}),
+                     left_over=[{"name": "8080/tcp", "address": "192.168.77.9", "why": "its former address", "until": None}],
+                     outside="100.64.3.4")
+        self.assertEqual(self.standing(), (REFUSED, "partly", ["refused", "waiting", "off"]))
+        self.expect("status", REFUSED,
+                    r"the provider's own(?s:.)*7 web +443/tcp to 8443 +refused +another device .*: 192.168.77.7 \(console\\x1b\[2J\), since \d"
+                    r"(?s:.)*\n8 +53,5000-5001/tcp, 53,5000/udp +open +since .*\n8 +5001/udp +waiting +taken, .*until 1970-01-01"
+                    r"(?s:.)*\n9 x +9/tcp +off\n(?s:.)*8080/tcp +192.168.77.9 +its former address\n(?s:.)*2 of 2 rules are not in force")
+        told = self.json("status")[1]
+        self.assertEqual((told["rules"][0]["ports"][0]["holder"]["address"], told["outside"]["kind"]), ("192.168.77.7", "carrier"))
+        # A rule that has been changed since the daemon looked is not taken for the one it saw.
+        self.publish(pid, (443, "tcp", {"box_port": 8444}))
+        self.assertEqual(self.standing(), (FAILED, "unknown", ["unknown", "open", "off"]))
+        for word, why, code, pattern in (("unreachable", "nobody answers", AWAY, "nobody answers, since .* upnpd looks again at"),
+                                         ("no_upnp", "switched off?", AWAY, "'sudo tavoportmap setup' looks for another way"),
+                                         ("busy", "", OK, "all 2 rules")):
+            self.publish(pid, router=word, router_why=why)
+            self.expect("status", code, pattern)
+        self.publish(pid, at=1, next_look=2)
+        self.expect("status", FAILED, "has not looked at the router since 1970")
+        put(ROUTER, (KNOWN % ("yes", "no")).replace(GATEWAY, "10.0.0.1"))
+        self.publish(pid)
+        self.expect("status", OK, "warning: the stored settings are those of the router 10.0.0.1, and the gateway is 192.168.77.1")
+        subprocess.run(["ip", "route", "del", "default"], check=True)
+        self.expect("status", AWAY, "no default gateway")
+        subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True)
+        put(RULES, "")
+        self.expect("status", OK, "no rules are in force")
+
+    def test_status_of_a_router_that_is_driven_through_its_pages(self):
+        self.keep(on="none", alive=False)
+        put(ROUTER, KNOWN % ("no", "no"))
+        self.assertEqual(self.standing(), (FAILED, "unknown", ["unknown", "unknown", "off"]))
+        self.publish(1, name="tavoportforward", protocol="pages")
+        self.expect("status", OK, "all 2 rules are in force, as the router's pages took them at")
+        self.expect("status --live", OK, "warning: what stands in a router's own pages is not read back")
+        self.expect("router table", FAILED, "its table stands there, mostly at http://192.168.77.1/")
+
+    def test_status_takes_nobodys_word_but_roots(self):
+        path = "/run/tavo/upnpd.json"
+        pid = self.keep()
+        self.publish(pid)
+        good = get(path)
+        untold = (FAILED, "unknown", ["unknown", "unknown", "off"])
+        for damage in (lambda: os.chmod(path, 0o666), lambda: os.chmod("/run/tavo", 0o777),
+                       lambda: (os.rename(path, "/run/tavo/other"), os.symlink("other", path)),
+                       lambda: (os.unlink(path), os.mkfifo(path)), lambda: (os.unlink(path), os.mkdir(path)),
+                       lambda: put(path, ""), lambda: put(path, good[:-9]), lambda: put(path, "[" * 100000),
+                       lambda: put(path, '["UPnP"]'), lambda: put(path, good + "{"), lambda: os.truncate(path, 1 << 30),
+                       lambda: put(path, good.replace(f'"pid": {pid}', '"pid": 1')),
+                       lambda: put(path, good.replace(f'"pid": {pid}', '"pid": -5')),
+                       lambda: put(path, good.replace('"rules": [', '"rules": {"a":[').replace("]", "]}", 1)),
+                       lambda: put(path, re.sub(r'"router_port": \d+', '"router_port": 99999999999999999999', good)),
+                       lambda: put(path, re.sub(r'"(state|protocol)": "[^"]*"', r'"\1": ["open"]', good))):
+            self.assertEqual(self.standing(), (OK, "in_force", ["open", "open", "off"]))
+            damage()
+            self.assertEqual(self.standing(), untold)
+            shutil.rmtree("/run/tavo")
+            os.mkdir("/run/tavo")
+            put(path, good)
+
+    def test_status_without_root(self):
+        pid = self.keep()
+        self.publish(pid, (443, "tcp", {"state": "refused", "why": "taken"}))
+        user = ("setpriv", "--bounding-set=-dac_override,-dac_read_search")
+        for path in (RULES, ROUTER):
+            os.chmod(path, 0)
+        for seen in (True, False):
+            run = subprocess.run([*user, TOOL, "status"], text=True, capture_output=True, check=False)
+            self.assertIn("run it with sudo", run.stdout)
+            self.assertEqual(run.returncode, REFUSED if seen else FAILED, run.stderr)
+            self.assertEqual(("web   443/tcp to 8443" in run.stdout, "refused  taken" in run.stdout), (seen, seen), run.stdout)
+            os.unlink("/run/tavo/upnpd.json") if seen else None
+
+    def test_status_asks_the_router_itself_when_it_is_told_to(self):
+        self.publish(self.keep())
+        other, mine = "TCP:443", "TCP:443@192.168.77.2:8443"
+        rest = " TCP:53@192.168.77.2:53 UDP:53@192.168.77.2:53 TCP:5000@192.168.77.2:5000 TCP:5001@192.168.77.2:5001 " \
+               "UDP:5000@192.168.77.2:5000 UDP:5001@192.168.77.2:5001 TCP:7@192.168.77.2:70"
+        for table, code, pattern in ((mine + rest, OK, "7/tcp +70 +console(?s:.)*all 2 rules are in force"),
+                                     (other + rest, REFUSED, r"web +443/tcp to 8443 +refused +another device .*192.168.77.99 \(console\\x1b"),
+                                     ("TCP:443@192.168.77.2:1" + rest, REFUSED, "the router leads it to port 1 of this box"),
+                                     (rest, REFUSED, "web .* waiting +it is not in the router's table now")):
+            self.expect("status --live", code, pattern, LD_PRELOAD=STAND_IN, TAVO_USED=table)
+        self.expect("status --live", AWAY, "no router answers by UPnP now", LD_PRELOAD=STAND_IN)
+        self.expect("router table", OK, r"443/tcp +192.168.77.2:8443 +ours +for good(?s:.)*7/tcp +192.168.77.2:70 +this box(?s:.)*9/udp +192.168.77.99:0 +for good +console\\x1b",
+                    LD_PRELOAD=STAND_IN, TAVO_USED=mine + rest + " UDP:9")
+        self.expect("router table", AWAY, "no router answers by UPnP at 192.168.77.1", LD_PRELOAD=STAND_IN)
+        self.publish(self.keep(on="natpmp"), name="natpmpd", protocol="NAT-PMP")
+        self.expect("status --live", OK, "warning: a NAT-PMP router cannot be asked", LD_PRELOAD=STAND_IN)
+        self.expect("router table", FAILED, "'tavoportmap status' shows what it granted", LD_PRELOAD=STAND_IN)
+
+    def test_status_watches_until_it_is_stopped(self):
+        pid = self.keep()
+        self.publish(pid)
+        for arguments, before, after in (((), "all 2 rules are in force", "443/tcp to 8443: refused, taken"),
+                                         (("--json",), '"standing":"in_force"', '"standing":"partly"')):
+            with subprocess.Popen([TOOL, "status", "--watch", *arguments], text=True, stdout=subprocess.PIPE) as run:
+                while before not in (line := run.stdout.readline()):
+                    self.assertTrue(line)
+                self.publish(pid, (443, "tcp", {"state": "refused", "why": "taken"}))
+                while after not in (line := run.stdout.readline()):
+                    self.assertTrue(line)
+                run.send_signal(signal.SIGINT)
+                self.assertEqual(run.wait(timeout=10), REFUSED)
+            self.publish(pid)
+
+    def test_status_knows_a_detection_by_its_lock(self):
+        self.keep(on="none", alive=False)
+        for path in ("/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock"):
+            with open(path, "w", encoding="utf-8") as lock:
+                fcntl.flock(lock, fcntl.LOCK_EX)
+                self.expect("status", AWAY, "running now +a detection(?s:.)*nothing is kept while a detection of the router goes on")
+        self.assertEqual(self.json("status")[1]["running"], "idle")
 
     # ---- relay services -------------------------------------------------------------------------
 
