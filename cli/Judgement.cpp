@@ -339,6 +339,12 @@ std::vector<std::string> WarningsOf(const Situation& situation) {
     if (pWord != nullptr && !pWord->blRulesReadable) {
         rgszWarnings.emplace_back(kUnreadable);
     }
+    if (situation.rules.blDraft) {
+        rgszWarnings.push_back(situation.rules.draft
+                                   ? "the changes below 'not saved yet' open and close nothing until 'sudo tavoportmap "
+                                     "save' puts them in force; 'sudo tavoportmap rules discard' forgets them"
+                                   : Unreadable().szMessage);
+    }
     if (situation.blSettingsHidden || situation.rules.blHidden) {
         rgszWarnings.emplace_back(
             "not all of it may be read by this user: run it with sudo to see the router's "

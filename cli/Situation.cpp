@@ -39,6 +39,9 @@ StoredRules ReadStoredRules() {
     StoredRules rules{.blHidden = IsHidden(kRuleFile)};
     if (!rules.blHidden) {
         rules.inForce = LoadRules();
+        rules.blDraft = HasDraft();
+        rules.draft = rules.blDraft ? LoadDraft() : std::nullopt;
+        rules.off = LoadOff();
     }
     return rules;
 }

@@ -46,6 +46,14 @@ Json::Value RuleJson(const RuleFact& fact) {
     return js;
 }
 
+Json::Value RulesJson(const Rules& rules) {
+    Json::Value js = Json::arrayValue;
+    for (const Rule& rule : rules) {
+        js.append(ToJson(rule));
+    }
+    return js;
+}
+
 Json::Value DaemonJson(const Daemon& daemon) {
     Json::Value js;
     js["switched_on"] = daemon.blSwitchedOn;
@@ -163,6 +171,8 @@ Json::Value ToJson(const Situation& situation, const Judgement& judgement) {
         js["rules"].append(RuleJson(fact));
     }
     js["rules_readable"] = !rules.blHidden && rules.inForce.has_value();
+    js["draft"] = rules.draft ? RulesJson(*rules.draft) : Json::Value();
+    js["off"] = rules.off ? RulesJson(*rules.off) : Json::Value();
     js["left_over"] = LeftOverJson(situation);
     js["others"] = OthersJson(situation, judgement);
     js["running"] = situation.running.szWord;

@@ -130,6 +130,10 @@ std::string StateWord(Fate enFate) {
 
 // ---- rows -----------------------------------------------------------------------------------------------------
 
+std::string NameOf(const Rule& rule) {
+    return Clean(rule.szId + (rule.szId.empty() || rule.szName.empty() ? "" : " ") + rule.szName);
+}
+
 std::string WholePorts(const Rule& rule) {
     const std::string szPorts = rule.szRouterPorts + (rule.szProtocol.empty() ? "" : "/" + rule.szProtocol);
     return Clean(rule.szBoxPorts.empty() || rule.szBoxPorts == rule.szRouterPorts ? szPorts
@@ -169,7 +173,7 @@ std::vector<std::pair<PortFact, std::vector<PortPair>>> Groups(const RuleFact& f
 // Name, ports, state and words of each group of ports.
 std::vector<std::vector<std::string>> RowsOf(const RuleFact& fact, int64_t nNow) {
     const Rule& rule = fact.rule;
-    const std::string szName = Clean(rule.szId + (rule.szId.empty() || rule.szName.empty() ? "" : " ") + rule.szName);
+    const std::string szName = NameOf(rule);
     const auto rgGroups = Groups(fact);
     if (rgGroups.empty()) {
         return {{szName, WholePorts(rule), StateWord(fact.enFate), Clean(fact.szWhy)}};
@@ -181,6 +185,32 @@ std::vector<std::vector<std::string>> RowsOf(const RuleFact& fact, int64_t nNow)
             {szName, blWhole ? WholePorts(rule) : SomePorts(rgPairs), StateWord(port.enFate), FactWords(port, nNow)});
     }
     return rgRows;
+}
+
+// What the next save would change.
+std::string DraftText(const Situation& situation) {
+    Table table({"not saved yet", "port", ""});
+    if (!situation.rules.draft || !situation.rules.inForce) {
+        return "";
+    }
+    const Rules& draft = *situation.rules.draft;
+    const Rules& inForce = *situation.rules.inForce;
+    const std::vector<size_t> rgBefore = Fellows(draft, inForce);
+    const std::vector<size_t> rgAfter = Fellows(inForce, draft);
+    for (size_t i = 0; i < draft.size(); ++i) {
+        const bool blNew = rgBefore[i] == std::string::npos;
+        if (blNew || ToJson(draft[i]) != ToJson(inForce[rgBefore[i]])) {
+            const char* szWhat = blNew ? "new" : "changed";
+            table.Add({NameOf(draft[i]), WholePorts(draft[i]),
+                       fmt::format("{}{}", szWhat, draft[i].blEnabled ? "" : ", switched off")});
+        }
+    }
+    for (size_t i = 0; i < inForce.size(); ++i) {
+        if (rgAfter[i] == std::string::npos) {
+            table.Add({NameOf(inForce[i]), WholePorts(inForce[i]), "removed"});
+        }
+    }
+    return table.ToText();
 }
 
 std::string OthersText(const Judgement& judgement) {
@@ -232,7 +262,7 @@ std::string ToText(const Situation& situation, const Judgement& judgement, bool 
         {"rules", RuleWords(situation)},
         {"running now", situation.running.ToText()},
     });
-    return Blocks({szHead, table.ToText(), LeftOverText(situation), OthersText(judgement)});
+    return Blocks({szHead, table.ToText(), DraftText(situation), LeftOverText(situation), OthersText(judgement)});
 }
 
 std::vector<std::string> ToLines(const Situation& situation, const Judgement& judgement) {

@@ -787,6 +787,12 @@ class Tool(unittest.TestCase):
         subprocess.run(["ip", "route", "del", "default"], check=True)
         self.expect("status", AWAY, "no default gateway")
         subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True)
+        tool("rules", "add", "new", "--router-port", "81")
+        tool("rules", "remove", "7")
+        self.expect("status", OK, r"10 new +81/tcp +new\n7 web +443/tcp to 8443 +removed\n(?s:.)*all 2 rules are in force"
+                                  "(?s:.)*warning: .*'sudo tavoportmap save' puts them in force")
+        self.assertEqual([rule["router_ports"] for rule in self.json("status")[1]["draft"]], ["53,5000-5001", "9", "81"])
+        tool("rules", "discard")
         put(RULES, "")
         self.expect("status", OK, "no rules are in force")
 
