@@ -1034,7 +1034,9 @@ class Tool(unittest.TestCase):
                 udp dport 7014 counter dnat to 172.29.0.2
                 tcp dport != 7015 dnat to 172.29.0.2
                 tcp dport 7016 dnat to 192.168.77.9
-                tcp dport 7017 accept } }""")
+                tcp dport 7017 accept
+                }
+            }""")
             told = subprocess.run([f"{BUILD}/tests/cli/listeners"], capture_output=True, text=True, check=True).stdout
             other.stdin.close()
         self.assertEqual(told.splitlines(), [
