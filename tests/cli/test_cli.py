@@ -210,6 +210,7 @@ class Tool(unittest.TestCase):
         describe("Alderman", "Homestead \u4e2d\u6587 2 with a long name that goes on", "1.0")
         tool("rules", "add", "a name longer than a narrow terminal is wide, and some", "--router-port", "80,443,8000-8010")
         tool("rules", "add", "web", "--router-port", "443", "--box-port", "8443", "--force")
+        self.saved()
         world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": "0 0 5 2 2 0 -1 10 80", "TAVO_REACH": "2 3 " + "0 NOLISTEN " * 12}
         wide = lambda text: sum(1 + (char >= "\u1100") for char in text)
         for width in (40, 80):
@@ -427,7 +428,7 @@ class Tool(unittest.TestCase):
         self.expect("save", REFUSED, "would not give these ports.*80 to 81", LD_PRELOAD=STAND_IN, TAVO_SAVE="-1 8 80 to 81")
         put(ROUTER, KNOWN % ("no", "no"))
         describe("Acme", "R1", "1")
-        self.expect("save", OK, "handed to(?s:.)*warning: .*does not say what it took", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
+        self.expect("save", OK, "handed to(?s:.)*warning: .*did not say what they took", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
 
     def test_saving_by_the_library_itself(self):
         tool("rules", "add", "--router-port", "80")
