@@ -269,12 +269,14 @@ int TAVORunKeysForget() {
 
 int TAVORunKeysMend() {
     return AtBorder(-1, [] {
-        if (!ReadRecord()) {
-            return 0;
+        // Not even for a moment is the lock taken from who holds it between two calls of his.
+        const auto record = ReadRecord();
+        if (!record || IsAlive(*record)) {
+            return record ? 1 : 0;
         }
         // No lock file: nobody has locked anything since the boot.
         const Descriptor fdLock(open(kRouterLock, O_RDWR | O_NOFOLLOW | O_CLOEXEC));
-        if (fdLock.Get() >= 0 && flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
+        if (fdLock.Get() < 0 ? errno != ENOENT : flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
             return 1;
         }
         return MendLocked();

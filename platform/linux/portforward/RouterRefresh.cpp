@@ -86,14 +86,15 @@ std::optional<std::string> FetchAndUnpack(const std::string& szLocation, const f
     const std::string szNew = Quoted(scratch / "new");
     // 64 MiB bound what a server can fill the disk with: as it arrives, and in one file as it unpacks. tar
     // would mend a name that leads outside; who packs such a name means harm, and the whole archive is refused.
-    const std::string szCommand =
-        "ulimit -f 131072; export LC_ALL=C; exec >/dev/null 2>" + Quoted(scratch / "why") +
-        "; fail() { echo \"$1\" >&2; exit 1; }; timeout 300 /usr/tavo/bin/wget " + Quoted(szLocation + "/" + kArchive) +
-        " -O " + szArchive + " || exit 1; timeout 60 gzip -dc " + szArchive + " >" + szTar +
-        " || fail 'the archive is damaged or unpacks to more than 64 MiB'; tar -tf " + szTar +
-        " 2>/dev/null | grep -qE '^/|(^|/)[.][.](/|$)' && fail 'a name in the archive leads outside of it'; mkdir " +
-        szNew + " && timeout 60 tar -xf " + szTar + " -C " + szNew +
-        " --no-same-owner || fail 'the archive cannot be unpacked'";
+    const std::string szCommand = "ulimit -f 131072; export LC_ALL=C; exec >/dev/null 2>" + Quoted(scratch / "why") +
+                                  "; fail() { echo \"$1\" >&2; exit 1; }; timeout 300 /usr/tavo/bin/wget " +
+                                  Quoted(szLocation + "/" + kArchive) + " -O " + szArchive +
+                                  " || exit 1; timeout 60 gzip -dc " + szArchive + " >" + szTar +
+                                  " || fail 'the archive is damaged or unpacks to more than 64 MiB'; tar -tf " + szTar +
+                                  " 2>/dev/null | grep -qE '^/|(^|/)[.][.](/|$)' && fail 'a name in the archive leads "
+                                  "outside of it'; umask 022; mkdir " +
+                                  szNew + " && timeout 60 tar -xf " + szTar + " -C " + szNew +
+                                  " --no-same-owner --no-same-permissions || fail 'the archive cannot be unpacked'";
     if (TLIBCSystem(szCommand.c_str()) == 0) {
         return std::nullopt;
     }

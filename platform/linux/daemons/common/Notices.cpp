@@ -220,7 +220,9 @@ void Comparison::TellPorts() {
         const bool blSingly = rgPorts.size() <= kMostSingly;
         for (const Outcome& outcome : rgPorts) {
             const std::string szReason = Reason(outcome);
-            Tell(outcome.szName, enChange, NameOf(outcome) + (szReason.empty() ? "" : ": " + szReason));
+            if (!Tell(outcome.szName, enChange, NameOf(outcome) + (szReason.empty() ? "" : ": " + szReason))) {
+                continue;
+            }
             mRgNotices.back().rgPorts = {outcome};
             if (!blSingly) {
                 mRgNotices.pop_back();

@@ -132,9 +132,7 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
 }
 
 int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
-    if (!mBlMended) {
-        blRequested = MendRunKeys() || blRequested;
-    }
+    blRequested = MendRunKeys() || blRequested;
     if (blRequested) {
         ReadSettings();
         ReadRules();

@@ -30,6 +30,7 @@ using Clock = std::chrono::steady_clock;
 constexpr char kPath[] = "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
 constexpr size_t kMostHooks = 64;
 constexpr size_t kMostOutput = 300;
+constexpr int kLastPieces = 16;                       // of what an ended hook has said
 constexpr auto kKillAfter = std::chrono::seconds(2);  // between the polite signal and the other one
 constexpr int kNotRun = 127;
 constexpr int kSignalled = 128;
@@ -78,13 +79,15 @@ const char* Objection(int fdDirectory, const std::string& szName) {
     _exit(kNotRun);
 }
 
-// Takes what the hook says, as long as it is not too much; the rest is read and dropped.
-void TakeOutput(int fd, std::string& szOutput) {
+// Takes what the hook says, as long as it is not too much; the rest is read and dropped. A piece at a time: a hook
+// that never stops writing would else never be looked at by the clock.
+bool TakeOutput(int fd, std::string& szOutput) {
     std::array<char, 4096> rgBytes;
-    ssize_t nRead = 0;
-    while ((nRead = read(fd, rgBytes.data(), rgBytes.size())) > 0) {
+    const ssize_t nRead = read(fd, rgBytes.data(), rgBytes.size());
+    if (nRead > 0) {
         szOutput.append(rgBytes.data(), std::min(static_cast<size_t>(nRead), kMostOutput - szOutput.size()));
     }
+    return nRead > 0;
 }
 
 // Whether the child has ended by then. What it says is taken in the meantime.
@@ -95,12 +98,12 @@ bool WaitUntil(int fdProcess, int fdOutput, Clock::time_point end, std::string& 
         pollfd rgWaiting[] = {{fdProcess, POLLIN, 0}, {fdOutput, POLLIN, 0}};
         poll(rgWaiting, std::size(rgWaiting), static_cast<int>(nLeft));
         blEnded = rgWaiting[0].revents != 0;
-        if (rgWaiting[1].revents != 0) {
-            TakeOutput(fdOutput, szOutput);
-        }
-        if ((rgWaiting[1].revents & (POLLHUP | POLLERR)) != 0) {
+        if (rgWaiting[1].revents != 0 && !TakeOutput(fdOutput, szOutput) &&
+            (rgWaiting[1].revents & (POLLHUP | POLLERR)) != 0) {
             fdOutput = -1;  // nobody is there to say anything; poll passes over it
         }
+    }
+    for (int i = 0; blEnded && i < kLastPieces && TakeOutput(fdOutput, szOutput); ++i) {
     }
     return blEnded;
 }
