@@ -3,7 +3,6 @@
 
 #include <arpa/inet.h>
 #include <ifaddrs.h>
-#include <net/if.h>
 #include <netinet/in.h>
 #include <unistd.h>
 
@@ -62,7 +61,7 @@ std::string GlobalIpv6() {
     }
     const std::unique_ptr<ifaddrs, decltype(&freeifaddrs)> pOwned(pList, &freeifaddrs);
     for (const ifaddrs* p = pList; p != nullptr; p = p->ifa_next) {
-        if (p->ifa_addr == nullptr || p->ifa_addr->sa_family != AF_INET6 || (p->ifa_flags & IFF_LOOPBACK) != 0) {
+        if (p->ifa_addr == nullptr || p->ifa_addr->sa_family != AF_INET6) {
             continue;
         }
         sockaddr_in6 address = {};

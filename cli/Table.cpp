@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <charconv>
 #include <cstdlib>
+#include <iterator>
 #include <numeric>
 
 #include "Answer.h"
@@ -234,6 +235,11 @@ std::string Hang(const std::string& szHead, std::string_view szText, size_t nWid
     const size_t nIndent = szHead.find_first_not_of(' ') + kMoreIndent;
     return szHead.substr(0, szHead.find_last_not_of(' ') + 1) + "\n" + std::string(nIndent, ' ') +
            Flow(szText, nWidth, nIndent, nIndent);
+}
+
+void Table::Add(const std::vector<std::string>& rgszCells) {
+    std::vector<std::string>& rgszRow = mRgRows.emplace_back();
+    std::transform(rgszCells.begin(), rgszCells.end(), std::back_inserter(rgszRow), &Clean);
 }
 
 std::string Table::ToText() const {

@@ -27,8 +27,8 @@ std::string Hang(const std::string& szHead, std::string_view szText, size_t nWid
 class Table {
 public:
     explicit Table(std::vector<std::string> rgszHead) : mRgRows{std::move(rgszHead)} {}
-    // As many cells as the head has, cleaned.
-    void Add(std::vector<std::string> rgszCells) { mRgRows.push_back(std::move(rgszCells)); }
+    // As many cells as the head has. They are cleaned here: what stands in tables comes from routers and files.
+    void Add(const std::vector<std::string>& rgszCells);
     // For standard output; empty without rows.
     std::string ToText() const;
 

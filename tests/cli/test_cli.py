@@ -322,7 +322,7 @@ class Tool(unittest.TestCase):
         self.assertEqual({(port["action"], port["router_ports"], port["protocol"]) for port in told["ports"]},
                          {("keep", "80", "tcp"), ("refuse", "81", "tcp"), ("close", "53", "udp"), ("open", "6000-6002", "udp"),
                           ("refuse", "90", "tcp"), ("refuse", "5000", "tcp")})
-        self.expect("save --dry-run", REFUSED, r"refuse +90/tcp +another device has it on the router \(192.168.77.99\)", **world)
+        self.expect("save --dry-run", REFUSED, r"refuse +90/tcp +another device has it on the router \(192.168.77.99, console\\x1b", **world)
         self.expect("save --dry-run", REFUSED, r"refuse +81/tcp +to port 8081 of this box: rule \d+ wants it too", **world)
         tool("rules", "add", "--router-port", "91")
         self.expect("save --dry-run", TOO_MANY, "holds 5 rules and there are 6", **world)
