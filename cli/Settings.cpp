@@ -17,8 +17,8 @@ constexpr char kConfFile[] = "/etc/portforward/router.conf";
 constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
 
 constexpr char kManualRouter[] =
-    "this router is driven through its own pages, where a service's ports are never written; 'tavoportmap rules add' "
-    "and 'save' forward them";
+    "this router is driven through its own pages, where a service's ports are never written; 'tavoportmap open PORT' "
+    "forwards one by a rule of yours";
 
 Found Look(const std::string& szGateway, RouterConf& conf, bool blLock) {
     if (AreUnreadable(szGateway)) {
