@@ -62,7 +62,7 @@ class Daemon(unittest.TestCase):
         changes = LAB.start("router", "nft", "monitor", stdout=subprocess.PIPE, text=True)
         new = LAB.start("box", DAEMON, "--foreground", "--take-over")
         wait_for(lambda: LAB.daemon_pid() == new.pid, 10, "the new one has taken over")
-        self.assertFalse(os.path.exists(f"/proc/{old}") or LAB.watcher())
+        wait_for(lambda: not (os.path.exists(f"/proc/{old}") or LAB.watcher()), 5, "the old one and its parent are gone")
         self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
         self.assertEqual(LAB.daemon_pid(), new.pid)
         self.assertEqual(option("--hand-over"), 0)

@@ -63,7 +63,7 @@ class Detection(unittest.TestCase):
         self.assertFalse(LAB.reaches("tcp", 5001))
         self.assertIn("1 rule in force", LAB.run("box", f"{TOOL} save").stdout)
         self.assertTrue(LAB.reaches("tcp", 5001))
-        self.assertIn("upnpd runs", LAB.run("box", f"{TOOL} status").stdout)
+        self.assertIn("upnpd (runs)", LAB.run("box", f"{TOOL} status").stdout)
         LAB.run("box", f"{TOOL} rules remove 1")
         LAB.run("box", f"{TOOL} save")
         wait_for(lambda: not LAB.mappings(), 10, "the mapping is taken away")
