@@ -22,6 +22,7 @@ namespace tavo::cli {
 
 namespace {
 
+constexpr int kRulesWritten = 80;  // percent, once the rule file is written
 constexpr auto kPoll = std::chrono::milliseconds(50);
 constexpr auto kHandOver = std::chrono::seconds(5);
 constexpr auto kTakenAway = std::chrono::seconds(60);
@@ -57,8 +58,8 @@ bool WaitFor(std::chrono::seconds limit, Function fnDone) {
 }
 
 // Why a save without a status failed, although nothing was in its way beforehand.
-Reply WhyFailed(const StoredRouter& router, const Rules& rules) {
-    if (!AreStored(rules)) {
+Reply WhyFailed(const StoredRouter& router, const Rules& rules, const SaveResult& result) {
+    if (result.nProgress < kRulesWritten || !AreStored(rules)) {
         return Failure(
             "the rules could not be written to /etc/portforward; is the disk full or read-only? Nothing was "
             "changed: the old rules are in force");
@@ -223,7 +224,7 @@ Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, cons
         keys.Keep();
     }
     if (nResult != 0 && result.nStatus == 0) {
-        return WhyFailed(router, rules);
+        return WhyFailed(router, rules, result);
     }
     const auto published = PublishedSince(router, nStart);
     Reply reply = nResult == 0 ? Saved(szGateway, router, rules) : Explain(result, router, rules.size());

@@ -64,6 +64,7 @@ class RealRouter(unittest.TestCase):
         self.assertEqual(LAB.mappings(), {("udp", 5002): (BOX, 5002)})
         LAB.write("/etc/portforward/rule.conf", "this is no rule file\n")
         LAB.stop_daemon(signal.SIGKILL)
+        os.unlink(homelab.REMAP)
         answer = LAB.start("box", "/usr/tavo/sbin/natpmpd")
         self.assertEqual(answer.wait(10), 0)
         wait_for(lambda: os.path.exists(homelab.REMAP), 10, "the pass has ended")
