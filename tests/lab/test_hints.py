@@ -90,11 +90,17 @@ class Hints(unittest.TestCase):
             self.told[key] = run(command)
         return self.told[key]
 
+    @staticmethod
+    def led(way):
+        """The commands that made the state what it is: nothing as long as none has succeeded."""
+        last = max((place for place, (_, code, _) in enumerate(way, 1) if code == OK), default=0)
+        return tuple(step for step, _, _ in way[:last])
+
     def walk(self, command, arrange, remedy, path=()):
-        code, text = self.do(command, arrange, None, tuple(step for step, _, _ in path))
+        code, text = self.do(command, arrange, None, self.led(path))
         words = words_of(text)
         way = [*path, (command, code, words)]
-        before = tuple(step for step, _, _ in way)
+        before = self.led(way)
         shown = "\n".join(f"--- {step} -> {status}\n{said}" for step, status, said in way)
         self.assertFalse(path and code == USAGE, f"a hint that is no command:\n{shown}")
         self.assertNotIn(words, [said for _, _, said in path], f"a circle:\n{shown}")
