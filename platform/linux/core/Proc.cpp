@@ -4,7 +4,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -19,6 +18,7 @@
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/Spawn.h"
 #include "core/TextFile.h"
 #include "core/Unit.h"
 #include "tavo/core.h"
@@ -215,43 +215,6 @@ int Launch(char* const* rgszArguments) {
     return 0;
 }
 
-class SpawnSetup {
-public:
-    SpawnSetup() {
-        posix_spawn_file_actions_init(&mActions);
-        mNErr = posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
-        posix_spawnattr_init(&mAttributes);
-        sigset_t all;
-        sigset_t none;
-        sigfillset(&all);
-        sigemptyset(&none);
-        posix_spawnattr_setsigdefault(&mAttributes, &all);
-        posix_spawnattr_setsigmask(&mAttributes, &none);
-        posix_spawnattr_setflags(&mAttributes, POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK);
-    }
-    ~SpawnSetup() {
-        posix_spawn_file_actions_destroy(&mActions);
-        posix_spawnattr_destroy(&mAttributes);
-    }
-    SpawnSetup(const SpawnSetup&) = delete;
-    SpawnSetup& operator=(const SpawnSetup&) = delete;
-
-    // The child's pid, or -1; rather none than one that could hold our descriptors.
-    pid_t Spawn(const char* szPath, char* const* rgszArguments) const {
-        pid_t pid = -1;
-        if (mNErr != 0) {
-            return pid;
-        }
-        const int nErrno = posix_spawn(&pid, szPath, &mActions, &mAttributes, rgszArguments, environ);
-        return nErrno == 0 ? pid : -1;
-    }
-
-private:
-    posix_spawn_file_actions_t mActions;
-    posix_spawnattr_t mAttributes;
-    int mNErr = 0;
-};
-
 }  // namespace
 
 int TLIBCIsProcAlive(const char* szName) {
@@ -322,6 +285,7 @@ int TLIBCSystem(const char* szCommand) {
     char szShell[] = "sh";
     char szOption[] = "-c";
     char* const rgszArguments[] = {szShell, szOption, const_cast<char*>(szCommand), nullptr};
-    const pid_t pid = SpawnSetup().Spawn("/bin/sh", rgszArguments);
+    pid_t pid = -1;
+    tavo::SpawnSetup().Spawn(pid, "/bin/sh", rgszArguments, environ);
     return pid < 0 ? Fail(TLIBC_ERR_EXEC, __LINE__) : WaitFor(pid);
 }

@@ -2,8 +2,6 @@
 // messages apart. Promises: see HookQueue.h.
 #include "daemons/common/HookQueue.h"
 
-#include <signal.h>
-#include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <syslog.h>
@@ -13,6 +11,7 @@
 #include <cstring>
 
 #include "core/Directory.h"
+#include "core/Spawn.h"
 
 namespace tavo {
 
@@ -21,41 +20,14 @@ namespace {
 constexpr char kRunner[] = "/usr/tavo/bin/tavohook";
 constexpr int kQueueBytes = 32768;  // what waits for a slow hook is bounded
 
-class RunnerSetup {
-public:
-    explicit RunnerSetup(int fdFacts) {
-        posix_spawn_file_actions_init(&mActions);
-        posix_spawn_file_actions_adddup2(&mActions, fdFacts, STDIN_FILENO);
-        posix_spawn_file_actions_addclosefrom_np(&mActions, STDERR_FILENO + 1);
-        posix_spawnattr_init(&mAttributes);
-        sigset_t all;
-        sigset_t none;
-        sigfillset(&all);
-        sigemptyset(&none);
-        posix_spawnattr_setsigdefault(&mAttributes, &all);
-        posix_spawnattr_setsigmask(&mAttributes, &none);
-        posix_spawnattr_setflags(&mAttributes, POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSID);
-    }
-    ~RunnerSetup() {
-        posix_spawn_file_actions_destroy(&mActions);
-        posix_spawnattr_destroy(&mAttributes);
-    }
-    RunnerSetup(const RunnerSetup&) = delete;
-    RunnerSetup& operator=(const RunnerSetup&) = delete;
-
-    // The system's word for it; 0: *pPid is the runner.
-    int Spawn(pid_t* pPid) const {
-        char szName[] = "tavohook";
-        char szFollow[] = "--follow";
-        char* const rgszArguments[] = {szName, szFollow, nullptr};
-        char* const rgszEnvironment[] = {nullptr};
-        return posix_spawn(pPid, kRunner, &mActions, &mAttributes, rgszArguments, rgszEnvironment);
-    }
-
-private:
-    posix_spawn_file_actions_t mActions;
-    posix_spawnattr_t mAttributes;
-};
+// The system's word for it; 0: pid is the runner.
+int StartRunner(int fdFacts, pid_t& pid) {
+    char szName[] = "tavohook";
+    char szFollow[] = "--follow";
+    char* const rgszArguments[] = {szName, szFollow, nullptr};
+    char* const rgszEnvironment[] = {nullptr};
+    return SpawnSetup(fdFacts, true).Spawn(pid, kRunner, rgszArguments, rgszEnvironment);
+}
 
 }  // namespace
 
@@ -71,7 +43,7 @@ bool HookQueue::Start() {
     mFdFacts.Reset(rgFd[0]);
     const Descriptor fdRunner(rgFd[1]);
     setsockopt(mFdFacts.Get(), SOL_SOCKET, SO_SNDBUF, &kQueueBytes, sizeof(kQueueBytes));
-    const int nErrno = RunnerSetup(fdRunner.Get()).Spawn(&mPid);
+    const int nErrno = StartRunner(fdRunner.Get(), mPid);
     if (nErrno != 0) {
         mPid = -1;
         mFdFacts.Reset();
