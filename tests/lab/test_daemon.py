@@ -1,11 +1,13 @@
 """A daemon outside any service manager: started again after a crash, handed over, stopped whatever state it is in."""
+import contextlib
 import os
+import re
 import signal
 import subprocess
 import unittest
 
 import homelab
-from homelab import BOX, wait_for
+from homelab import BOX, HERE, wait_for
 
 LAB = None
 DAEMON = "/usr/tavo/sbin/upnpd"
@@ -71,6 +73,18 @@ class Daemon(unittest.TestCase):
         self.assertNotIn("delete rule", changes.stdout.read())
         self.assertEqual(LAB.mappings(), MAPPED)
         self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
+
+    def test_a_start_makes_the_lock_files_and_follows_no_link(self):
+        LAB.stop_daemon(signal.SIGKILL)
+        locks = re.findall(r"^f (\S+) 0600 root root", LAB.read(f"{HERE}/../../packaging/tmpfiles.conf"), re.M)
+        for path in locks:
+            with contextlib.suppress(FileNotFoundError):
+                os.unlink(path)
+        os.symlink("/tmp/victim", locks[0])
+        self.addCleanup(os.unlink, locks[0])
+        self.assertEqual(option(), 0)
+        self.assertFalse(os.path.exists("/tmp/victim"))
+        self.assertEqual([os.lstat(path).st_mode for path in locks[1:]], [0o100600] * 3)
 
     def test_a_stop_takes_the_mappings_away_whatever_is_left_to_stop(self):
         for before in (lambda: None, self.crash, lambda: os.kill(LAB.watcher(), signal.SIGKILL),

@@ -44,11 +44,11 @@ def is_free():
 
 @contextlib.contextmanager
 def little_space(path):
-    """The directory with what it holds, on a file system that is all but full."""
-    copy = subprocess.run(["tar", "-cC", path, "."], check=True, capture_output=True).stdout
-    subprocess.run(["mount", "-t", "tmpfs", "-o", "size=1m", "tmpfs", path], check=True)
+    """The directory with what it holds, on a file system that is full."""
+    copy = subprocess.run(["tar", "-cC", path, "."], check=False, capture_output=True).stdout  # not what nobody may read
+    subprocess.run(["mount", "-t", "tmpfs", "-o", "size=64m", "tmpfs", path], check=True)
     try:
-        subprocess.run(["tar", "-xC", path], input=copy, check=True)
+        subprocess.run(["tar", "--no-same-owner", "-xC", path], input=copy, check=True)
         used = subprocess.run(["df", "--output=used", "-k", path], check=True, capture_output=True, text=True).stdout
         subprocess.run(["mount", "-o", f"remount,size={int(used.split()[1])}k", path], check=True)
         yield
@@ -121,17 +121,20 @@ class Keys(unittest.TestCase):
         os.unlink("/usr/tavo/sbin/upnpd")
 
     def test_on_a_full_disk(self):
-        for place in ("/var/lib/tavo", "/etc/portforward"):
+        for place in ("/var/lib/tavo", "/etc/portforward", "/etc"):
             with self.subTest(place):
                 self.save()
+                before = LAB.read(KEYS)
                 with little_space(place):
                     run = tool("save")
                     self.assertEqual(run.returncode, FAILED, run.stdout + run.stderr)
+                    self.assertIn("full", run.stderr)
+                    self.assertEqual(LAB.read(KEYS), before)
                 self.restart()
 
     def test_after_a_kill_at_any_moment(self):
         killed = 0
-        for command, moments in (("save", (0, 0.01, 0.02, 0.03, 0.05, 0.08)), ("detect", (0.2, 1, 3)),
+        for command, moments in (("save", (0, 0.01, 0.02, 0.03, 0.05, 0.08)), ("detect", (0.2, 1, "off")),
                                  ("service set relay 5002/tcp", (0.02, 0.05))):
             for moment in moments:
                 with self.subTest(command=command, moment=moment):
@@ -140,7 +143,10 @@ class Keys(unittest.TestCase):
                     run = LAB.start("box", TOOL, *command.split(), stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
                     with contextlib.suppress(AssertionError):
                         wait_for(lambda: os.path.exists(RECORD) or run.poll() is not None, 10, "it has begun")
-                    time.sleep(moment)
+                    if moment == "off":
+                        wait_for(lambda: keys() == (False, False), 30, "it has switched the daemon off")
+                    else:
+                        time.sleep(moment)
                     killed += run.poll() is None
                     LAB.end(run)
                     LAB.start_router()
@@ -150,14 +156,18 @@ class Keys(unittest.TestCase):
         self.assertGreater(killed, 5)
 
     def test_a_living_daemon_is_told(self):
+        """Also where the lock of saves is none that it could trust."""
         self.save()
+        os.unlink("/tmp/routerconf.lock")
+        os.symlink("/tmp/elsewhere", "/tmp/routerconf.lock")
+        self.addCleanup(os.unlink, "/tmp/routerconf.lock")
         LAB.settings(check_interval=1)
         LAB.stop_daemon(signal.SIGTERM)
         LAB.start("box", "/usr/tavo/sbin/upnpd").wait(10)
         with subprocess.Popen(["/usr/bin/sleep", "60"]) as dead:
             dead.kill()
-        self.note(dead.pid)
         LAB.write(KEYS, 'runupnpportmapping="no"\n')
+        self.note(dead.pid)
         os.kill(LAB.daemon_pid(), signal.SIGHUP)
         wait_for(lambda: not os.path.exists(RECORD) and keys() == (True, False), 10, "it mends what the dead one left")
         self.assertEqual(LAB.mappings(), OPEN)
@@ -173,6 +183,9 @@ class Keys(unittest.TestCase):
         def writable():
             self.note(dead.pid)
             os.chmod(RECORD, 0o666)
+        def switched_off():
+            self.note(dead.pid)
+            LAB.write(KEYS, LAB.read(KEYS))  # word for word as it was: his doing all the same
         for name, make in (("nothing noted", lambda: None),
                            ("noted off", lambda: self.note(dead.pid, upnp="no")),
                            ("somebody who lives", lambda: self.note(os.getpid(), alive=True)),
@@ -180,6 +193,7 @@ class Keys(unittest.TestCase):
                            ("garbage", lambda: LAB.write(RECORD, "\0\1[keys]\nupnp=\"yes\"\n")),
                            ("another word", lambda: self.note(dead.pid, extra='more="1"\n')),
                            ("another router's settings since", lambda: self.note(dead.pid, router="absent")),
+                           ("switched off by somebody else since", switched_off),
                            ("a directory", lambda: os.makedirs(RECORD))):
             with self.subTest(name):
                 LAB.write(RULES, SEVERAL)
@@ -205,7 +219,8 @@ class Keys(unittest.TestCase):
         LAB.write(RECORD, f'[keys]\npid="{pid}"\nstart="{start}"\n'
                           f'boot="{LAB.read("/proc/sys/kernel/random/boot_id").strip()}"\nnatpmp="no"\nupnp="{upnp}"\n'
                           f'rules="{identity(RULES)}"\n'
-                          f'router="{router or identity("/etc/portforward/router.conf")}"\n{extra}\n')
+                          f'router="{router or identity("/etc/portforward/router.conf")}"\nsystem="{identity(KEYS)}"\n'
+                          f'{extra}\n')
 
 
 if __name__ == "__main__":

@@ -5,7 +5,9 @@
  * map. Saving and detection switch them off on their way; one that fails or is killed leaves them so, and
  * the next start of a daemon takes every port away. Whoever starts such an operation therefore notes the
  * keys in /var/lib/tavo/run_keys.conf first, with its own process and the state of rule.conf and
- * router.conf. A record that is no plain file of root's, or that holds anything else, is as good as none.
+ * router.conf. What it then does to the keys through TLIBCFileSetKeyValue() is noted there as its own; keys
+ * that anybody else writes afterwards stand. A record that is no plain file of root's, or that holds anything
+ * else, is as good as none.
  */
 #ifndef TAVO_RUNKEYS_H
 #define TAVO_RUNKEYS_H
@@ -21,7 +23,7 @@ extern "C" {
 int TAVORunKeysRemember(void);
 
 /* After an operation that came to nothing, with the router's lock held: puts the keys that this process
- * noted back where neither file has changed since. Where the rules were written but no key was switched on
+ * noted back where neither file has changed since, nor the keys by somebody else. Where the rules were written but no key was switched on
  * any more, the key of the router's settings is. A daemon whose key became "yes" is told (SIGHUP). 0: done
  * and forgotten, or there was no record of this process; -1: the keys cannot be written; the record stays. */
 int TAVORunKeysRestore(void);

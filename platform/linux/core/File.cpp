@@ -14,6 +14,7 @@
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/RunKeys.h"
 #include "core/TextFile.h"
 #include "tavo/core.h"
 
@@ -245,7 +246,8 @@ int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szVa
             szText = std::move(*szOld);
         }
         const std::string szLine = FormatKeyLine(szLineFormat, szKey, tavo::QuoteForShell(szValue));
-        return tavo::WriteFileAtomic(szPath, WithLine(szText, szKey, szLine), kKeyFileMode) ? 1 : -1;
+        const auto fnWhole = [szPath](int fdNew) { return tavo::NoteWrite(szPath, fdNew); };
+        return tavo::WriteFileAtomic(szPath, WithLine(szText, szKey, szLine), kKeyFileMode, fnWhole) ? 1 : -1;
     });
 }
 

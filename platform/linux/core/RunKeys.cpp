@@ -1,7 +1,7 @@
 // The record of the run keys. Relies on TextFile, on the rule file's and the router file's readers (which bring
 // back what a killed writer left aside) and on /proc. Promises: see runkeys.h; nothing of a record is believed
 // that no Remember() could have written.
-#include "tavo/runkeys.h"
+#include "core/RunKeys.h"
 
 #include <fcntl.h>
 #include <signal.h>
@@ -20,6 +20,7 @@
 #include "core/TextFile.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
+#include "tavo/runkeys.h"
 
 namespace {
 
@@ -56,8 +57,19 @@ struct Record {
     std::string szPid, szStart, szBoot;  // the process, which no other one can be taken for
     Keys keys;
     std::string szRules, szRouter;  // the two files
-    bool operator==(const Record&) const = default;
+    std::string szSystem;           // the file of the keys as the process left it, and as it was about to
+
+    std::string Owner() const { return szPid + " " + szStart + " " + szBoot; }
+    bool Left(const std::string& szIdentity) const {
+        return (" " + szSystem + " ").find(" " + szIdentity + " ") != std::string::npos;
+    }
 };
+
+// The record in whose name this process, and every child that it forks, writes the keys; empty: in nobody's.
+std::string& Operation() {
+    static std::string szOwner;
+    return szOwner;
+}
 
 // ---- processes and files -----------------------------------------------------------------------------------
 
@@ -88,13 +100,14 @@ std::string Boot() {
 }
 
 // Another text after every write of ours, the same after a writer that put the old file back.
-std::string IdentityOf(const char* szPath) {
-    struct stat status = {};
-    if (stat(szPath, &status) != 0) {
-        return errno == ENOENT ? "absent" : "unknown";
-    }
+std::string IdentityOf(const struct stat& status) {
     return std::to_string(status.st_ino) + "/" + std::to_string(status.st_size) + "/" +
            std::to_string(status.st_mtim.tv_sec) + "." + std::to_string(status.st_mtim.tv_nsec);
+}
+
+std::string IdentityOf(const char* szPath) {
+    struct stat status = {};
+    return stat(szPath, &status) == 0 ? IdentityOf(status) : errno == ENOENT ? "absent" : "unknown";
 }
 
 bool IsOn(const Daemon& daemon) {
@@ -107,8 +120,10 @@ Record Now() {
     TAVOPFConfFree(TAVOPFRuleGet());  // a reader brings back what a killed writer left aside
     TAVOPFConfFree(TAVOPFGwRouterConfGet());
     const std::string szPid = std::to_string(getpid());
+    const std::string szSystem = IdentityOf(kSystemConf);
     return {
-        szPid, StartOf(szPid), Boot(), {IsOn(kNatpmp), IsOn(kUpnp)}, IdentityOf(kRuleConf), IdentityOf(kRouterConf)};
+        szPid,   StartOf(szPid), Boot(), {IsOn(kNatpmp), IsOn(kUpnp)}, IdentityOf(kRuleConf), IdentityOf(kRouterConf),
+        szSystem};
 }
 
 // ---- the record --------------------------------------------------------------------------------------------
@@ -121,7 +136,8 @@ std::string ToText(const Record& record) {
                                    {"natpmp", record.keys.blNatpmp ? "yes" : "no"},
                                    {"upnp", record.keys.blUpnp ? "yes" : "no"},
                                    {"rules", record.szRules},
-                                   {"router", record.szRouter}}}});
+                                   {"router", record.szRouter},
+                                   {"system", record.szSystem}}}});
 }
 
 // The text of a record file that is root's alone; nothing for any other.
@@ -152,9 +168,9 @@ std::optional<Record> ReadRecord() {
             std::find_if(rgPairs.begin(), rgPairs.end(), [&](const tavo::Pair& pair) { return pair.szKey == szKey; });
         return it == rgPairs.end() ? std::string() : it->szValue;
     };
-    const Record record{fnGet("pid"),   fnGet("start"),
-                        fnGet("boot"),  {fnGet("natpmp") == "yes", fnGet("upnp") == "yes"},
-                        fnGet("rules"), fnGet("router")};
+    const Record record{
+        fnGet("pid"),   fnGet("start"),  fnGet("boot"),  {fnGet("natpmp") == "yes", fnGet("upnp") == "yes"},
+        fnGet("rules"), fnGet("router"), fnGet("system")};
     // What it does not say word for word as it is written, it does not say.
     const bool blWhole = IsNumber(record.szPid) && IsNumber(record.szStart) && ToText(record) == *szText;
     return blWhole ? std::optional(record) : std::nullopt;
@@ -187,8 +203,10 @@ Keys KeysBySettings() {
 
 // What the keys should be, by what has become of the files since the record was made.
 Keys Wanted(const Record& record, const Record& now) {
-    if (record.szRouter != now.szRouter) {
-        return now.keys;  // another router, or another way to drive it: the next save switches on what it needs
+    if (record.szRouter != now.szRouter || !record.Left(now.szSystem)) {
+        // Another router, or another way to drive it, of which the next save switches on what it needs; or somebody
+        // else has written the keys, and knows what he wants.
+        return now.keys;
     }
     if (record.szRules == now.szRules) {
         return record.keys;
@@ -225,8 +243,17 @@ int Forget() {
 int PutBack(const Record& record) {
     const Record now = Now();
     const Keys keys = Wanted(record, now);
-    return SetKey(kNatpmp, now.keys.blNatpmp, keys.blNatpmp) && SetKey(kUpnp, now.keys.blUpnp, keys.blUpnp) ? Forget()
-                                                                                                            : -1;
+    Operation() = record.Owner();  // whoever is killed between two keys leaves the second one to the next
+    const bool blSet = SetKey(kNatpmp, now.keys.blNatpmp, keys.blNatpmp) && SetKey(kUpnp, now.keys.blUpnp, keys.blUpnp);
+    Operation().clear();
+    return blSet ? Forget() : -1;
+}
+
+// What is missing, nobody has locked since the boot; and what somebody else has put into /tmp in its place, he could
+// lock for ever.
+bool IsRouterLockOurs() {
+    struct stat status = {};
+    return lstat(kRouterLock, &status) == 0 && S_ISREG(status.st_mode) && status.st_uid == geteuid();
 }
 
 // 0: nothing is left of a dead process; 1: the one that noted is alive; -1.
@@ -236,6 +263,18 @@ int MendLocked() {
 }
 
 }  // namespace
+
+bool tavo::NoteWrite(std::string_view szPath, int fdNew) {
+    auto record = szPath == kSystemConf && !Operation().empty() ? ReadRecord() : std::nullopt;
+    if (!record || record->Owner() != Operation()) {
+        return true;
+    }
+    struct stat status = {};
+    const std::string szNow = IdentityOf(kSystemConf);
+    const std::string szBefore = record->Left(szNow) ? szNow + " " : "";
+    record->szSystem = fstat(fdNew, &status) == 0 ? szBefore + IdentityOf(status) : szBefore;
+    return WriteFileAtomic(kRecord, ToText(*record));
+}
 
 int TAVORunKeysRemember() {
     return AtBorder(-1, [] {
@@ -249,7 +288,9 @@ int TAVORunKeysRemember() {
         if (!OwnText()) {
             unlink(kRecord);  // a link, or somebody else's: it is not followed, and not written into
         }
-        return tavo::WriteFileAtomic(kRecord, ToText(Now())) ? 0 : -1;
+        const Record record = Now();
+        Operation() = record.Owner();
+        return tavo::WriteFileAtomic(kRecord, ToText(record)) ? 0 : -1;
     });
 }
 
@@ -262,6 +303,7 @@ int TAVORunKeysRestore() {
 
 int TAVORunKeysForget() {
     return AtBorder(-1, [] {
+        Operation().clear();
         const auto record = ReadRecord();
         return record && IsOurs(*record) ? Forget() : 0;
     });
@@ -274,9 +316,8 @@ int TAVORunKeysMend() {
         if (!record || IsAlive(*record)) {
             return record ? 1 : 0;
         }
-        // No lock file: nobody has locked anything since the boot.
-        const Descriptor fdLock(open(kRouterLock, O_RDWR | O_NOFOLLOW | O_CLOEXEC));
-        if (fdLock.Get() < 0 ? errno != ENOENT : flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
+        const Descriptor fdLock(open(kRouterLock, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+        if (IsRouterLockOurs() && (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0)) {
             return 1;
         }
         return MendLocked();

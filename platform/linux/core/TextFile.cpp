@@ -291,14 +291,16 @@ std::optional<std::string> ReadFile(const std::string& szPath) {
     }
 }
 
-bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode) {
+bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode,
+                     const std::function<bool(int fd)>& fnWhole) {
     const std::string szTarget = Resolve(szPath);
     const std::string szDir = DirectoryOf(szTarget);  // beforehand: nothing may fail any more after the renaming
     NewFile file(szTarget);
     if (file.Fd() < 0) {
         return Fail(TLIBC_ERR_OPEN, __LINE__);
     }
-    if (!KeepOwnerAndMode(file.Fd(), szTarget, nNewMode) || !WriteAll(file.Fd(), szText) || fsync(file.Fd()) != 0) {
+    if (!KeepOwnerAndMode(file.Fd(), szTarget, nNewMode) || !WriteAll(file.Fd(), szText) || fsync(file.Fd()) != 0 ||
+        (fnWhole && !fnWhole(file.Fd()))) {
         return Fail(TLIBC_ERR_WRITE, __LINE__);
     }
     if (!file.Rename(szTarget)) {

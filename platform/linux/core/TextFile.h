@@ -5,6 +5,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -35,9 +36,11 @@ std::string DirectoryOf(const std::string& szPath);
 TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath);
 
 // Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
-// (nNewMode for a new file), renamed over it. A link is followed. False with the last error set.
+// (nNewMode for a new file), renamed over it. A link is followed. fnWhole is shown the new file while the old one
+// stands, and may refuse it. False with the last error set.
 TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_view szText,
-                                       mode_t nNewMode = kPrivateMode);
+                                       mode_t nNewMode = kPrivateMode,
+                                       const std::function<bool(int fd)>& fnWhole = nullptr);
 
 // All sections in file order; two of one name stay two. Nothing when any line is neither section, pair,
 // comment nor blank; pnBadLine, where given, is its number.

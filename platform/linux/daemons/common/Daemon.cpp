@@ -50,6 +50,9 @@ constexpr int kExitUsage = 2;
 constexpr char kMarkerDir[] = "/tmp";
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
+// As in tmpfiles.d, which makes them at the boot where systemd runs.
+constexpr const char* kLockFiles[] = {"/tmp/routerconf.lock", "/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock",
+                                      "/tmp/upnp_test.lock"};
 constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
 constexpr auto kEndLimit = std::chrono::seconds(20);   // for another instance: a pass, and the mappings
@@ -224,6 +227,14 @@ void Frame::Loop() {
     Stop();
 }
 
+// The locks of saves, detections and tests, before anybody else can put something of his own in their places: a link,
+// or a file that he holds.
+void MakeLockFiles() {
+    for (const char* szPath : kLockFiles) {
+        Descriptor(open(szPath, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kPrivateMode));
+    }
+}
+
 int AnotherRuns(const DaemonNames& names) {
     syslog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
     return 1;
@@ -235,6 +246,7 @@ int RunInstance(Mapper& mapper, Descriptor& fdReady) {
     if (!instance.Take()) {
         return AnotherRuns(names);
     }
+    MakeLockFiles();
     Frame frame(mapper);
     WritePidFile(names);
     const bool blTold = fdReady.Get() < 0 || write(fdReady.Get(), "r", 1) == 1;
