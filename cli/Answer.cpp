@@ -94,6 +94,10 @@ int Print(const Reply& reply, bool blJson) {
     return blWritten ? reply.enExit : kFailed;
 }
 
+void Tell(const std::string& szText) {
+    Write(stderr, szText);
+}
+
 std::string Clean(std::string_view szText) {
     std::string szClean;
     while (!szText.empty()) {

@@ -24,9 +24,18 @@ struct Reply {
 // Shows the reply; the exit code of the program. A reply that cannot be written is a failure.
 int Print(const Reply& reply, bool blJson);
 
+// On standard error, whether or not anybody reads it there: never an exception, which would end what is told of.
+void Tell(const std::string& szText);
+
 // szText with everything that could drive a terminal, reorder its line or break its encoding shown as
 // an escape such as \x1b.
 std::string Clean(std::string_view szText);
+
+// "1 rule", "no rules"; never a negative number.
+template <typename Number>
+std::string Count(Number nCount, const std::string& szWhat) {
+    return (nCount > 0 ? std::to_string(nCount) : "no") + " " + szWhat + (nCount == 1 ? "" : "s");
+}
 
 enum class Ink { kBold, kRed, kYellow };
 // Whether escape sequences may be written to this descriptor at all.

@@ -42,21 +42,22 @@ Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnC
 
 // ---- close -------------------------------------------------------------------------------------------------
 
-// The ports that a word means: those of the rules with this name, else those that it says.
-std::vector<PortPair> Meant(const Rules& rules, const std::string& szWord) {
+// The ports that a word means: a number is a port, whatever rules are called; else those of the rules with this name,
+// else those that the word stands for. Nothing when it means none.
+std::optional<std::vector<PortPair>> Meant(const Rules& rules, const std::string& szWord) {
+    const auto wish = ReadPortWish(szWord);
     Rules named;
     std::copy_if(rules.begin(), rules.end(), std::back_inserter(named),
                  [&](const Rule& rule) { return !szWord.empty() && rule.szName == szWord; });
-    if (!named.empty()) {
+    if (!named.empty() && !(wish && wish->szName.empty())) {
         return PairsOf(named);
     }
-    const auto wish = ReadPortWish(szWord);
     if (!wish) {
-        return {};
+        return std::nullopt;
     }
     // Without a word for the protocol both are meant: what is closed is not opened by mistake.
     const std::string szProtocol = szWord.find('/') == std::string::npos ? "all" : wish->szProtocol;
-    return PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""}).value_or(std::vector<PortPair>());
+    return PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""});
 }
 
 Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
@@ -65,17 +66,14 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
     const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
         std::vector<PortPair> rgAll;
         for (const std::string& szWord : rgszWords) {
-            const std::vector<PortPair> rgPairs = Meant(rules, szWord);
-            const bool blNamed =
-                std::any_of(rules.begin(), rules.end(), [&](const Rule& rule) { return rule.szName == szWord; });
-            if (rgPairs.empty() && !blNamed) {
-                Reply reply = NoSuchRule(rules, szWord);
-                reply.szMessage =
-                    fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap rules list' shows them",
-                                Clean(szWord));
-                return reply;
+            const auto rgPairs = Meant(rules, szWord);
+            if (!rgPairs) {
+                return Reply{.enExit = kUsage,
+                             .szMessage = fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap "
+                                                      "rules list' shows them",
+                                                      Clean(szWord))};
             }
-            rgAll.insert(rgAll.end(), rgPairs.begin(), rgPairs.end());
+            rgAll.insert(rgAll.end(), rgPairs->begin(), rgPairs->end());
         }
         nClosed = Close(rules, rgAll);
         return nClosed > 0 ? std::nullopt
@@ -150,6 +148,11 @@ size_t SwitchOn(Rules& rules, const Rules& before) {
 Reply On(bool blJson) {
     const auto fnChange = [](Rules& rules) -> std::optional<Reply> {
         const auto before = LoadOff();
+        if (!before && IsOffUnreadable()) {
+            return Failure(
+                "what 'off' has switched off cannot be read (/etc/portforward/rules.off); 'tavoportmap rules list' "
+                "shows the rules, 'tavoportmap rules enable RULE' and 'tavoportmap save' open one again");
+        }
         if (!before) {
             return Reply{.szMessage = "nothing to switch on: nothing was switched off by 'tavoportmap off'"};
         }

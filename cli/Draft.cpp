@@ -3,9 +3,9 @@
 #include <fmt/format.h>
 
 #include <algorithm>
-#include <memory>
 
 #include "Box.h"
+#include "JsonText.h"
 #include "RuleStore.h"
 #include "TextFile.h"
 
@@ -19,11 +19,10 @@ constexpr size_t kNone = std::string::npos;
 
 // ---- rules in JSON -----------------------------------------------------------------------------------------
 
-bool Parse(const std::string& szText, Json::Value& js) {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    const std::unique_ptr<Json::CharReader> pReader(builder.newCharReader());
-    return pReader->parse(szText.data(), szText.data() + szText.size(), &js, nullptr) && js.isObject();
+// The object that szText is, without members where it is none.
+Json::Value ObjectOf(const std::string& szText) {
+    const auto js = ReadJson(szText);
+    return js && js->isObject() ? *js : Json::objectValue;
 }
 
 std::string Format(const Json::Value& js) {
@@ -32,9 +31,9 @@ std::string Format(const Json::Value& js) {
 
 // A text as it is, or the numbers of its bytes where JSON cannot hold it.
 Json::Value Lossless(const std::string& szText) {
-    Json::Value js, jsBack;
+    Json::Value js;
     js["t"] = szText;
-    if (Parse(Format(js), jsBack) && jsBack["t"] == js["t"]) {
+    if (ObjectOf(Format(js))["t"] == js["t"]) {
         return js["t"];
     }
     Json::Value jsBytes = Json::arrayValue;
@@ -166,6 +165,11 @@ void Append(Rule rule, Rules& rules) {
     rules.push_back(std::move(rule));
 }
 
+bool IsEveryRuleOff() {
+    const auto inForce = LoadRules();
+    return inForce && std::none_of(inForce->begin(), inForce->end(), [](const Rule& rule) { return rule.blEnabled; });
+}
+
 }  // namespace
 
 bool IsSameContent(const Rule& one, const Rule& other) {
@@ -216,10 +220,10 @@ std::optional<Rules> LoadDraft() {
     if (!inForce || enState == ReadState::kAbsent) {
         return inForce;
     }
-    Json::Value js;
-    if (enState == ReadState::kUnreadable || !Parse(szText, js)) {
+    if (enState == ReadState::kUnreadable) {
         return std::nullopt;
     }
+    const Json::Value js = ObjectOf(szText);
     const auto base = FromFile(js["base"]);
     const auto edited = FromFile(js["rules"]);
     return base && edited ? std::optional(Rebase(*base, *edited, *inForce)) : std::nullopt;
@@ -264,14 +268,13 @@ Reply Unreadable() {
 
 std::optional<Rules> LoadOff() {
     std::string szText;
-    Json::Value js;
-    const auto inForce = LoadRules();
-    const bool blClosed =
-        inForce && std::none_of(inForce->begin(), inForce->end(), [](const Rule& rule) { return rule.blEnabled; });
-    if (!blClosed || ReadOwnFile(kOff, szText) != ReadState::kRead || !Parse(szText, js)) {
-        return std::nullopt;
-    }
-    return FromFile(js["rules"]);
+    return IsEveryRuleOff() && ReadOwnFile(kOff, szText) == ReadState::kRead ? FromFile(ObjectOf(szText)["rules"])
+                                                                             : std::nullopt;
+}
+
+bool IsOffUnreadable() {
+    std::string szText;
+    return IsEveryRuleOff() && !IsOff() && ReadOwnFile(kOff, szText) != ReadState::kAbsent;
 }
 
 bool StoreOff(const Rules& rules) {

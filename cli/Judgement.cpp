@@ -159,10 +159,6 @@ std::vector<LiveEntry> OthersOf(const Situation& situation, const std::vector<Ru
 // What is so, and how it is said.
 using Outcome = std::pair<Standing, std::string>;
 
-std::string CountOf(size_t nRules) {
-    return nRules == 1 ? "1 rule" : fmt::format("{} rules", nRules);
-}
-
 // Nobody may map although rules wait for it.
 std::string WhySwitchedOff(const Situation& situation) {
     if (situation.running.szWord != "idle") {
@@ -270,7 +266,7 @@ std::optional<Outcome> JudgeWish(const Situation& situation, size_t nWanted) {
     }
     if (situation.rules.off) {
         return Outcome{Standing::kOff, fmt::format("switched off: {} wait for 'sudo tavoportmap on'",
-                                                   CountOf(situation.rules.off->size()))};
+                                                   Count(situation.rules.off->size(), "rule"))};
     }
     return Outcome{Standing::kNothingAsked,
                    situation.rules.inForce->empty()
@@ -296,7 +292,8 @@ Outcome JudgeRules(const Situation& situation, const std::vector<RuleFact>& rgRu
                                                               nWrong, nWanted, szAsOf)};
     }
     if (nUnknown > 0) {
-        return {Standing::kUntold, fmt::format("{} of {} cannot be told yet{}", nUnknown, CountOf(nWanted), szAsOf)};
+        return {Standing::kUntold,
+                fmt::format("{} of {} cannot be told yet{}", nUnknown, Count(nWanted, "rule"), szAsOf)};
     }
     return {Standing::kInForce, nWanted == 1 ? "the rule is in force" + szAsOf
                                              : fmt::format("all {} rules are in force{}", nWanted, szAsOf)};

@@ -3,7 +3,6 @@
 #include "Listeners.h"
 
 #include <arpa/inet.h>
-#include <json/json.h>
 
 #include <algorithm>
 #include <array>
@@ -11,12 +10,12 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
-#include <memory>
 #include <optional>
 #include <sstream>
 #include <tuple>
 
 #include "Child.h"
+#include "JsonText.h"
 #include "tavo/net.h"
 
 namespace tavo::cli {
@@ -241,14 +240,12 @@ void Sort(std::vector<Listener>& rgListeners) {
 
 std::vector<Listener> ReadPublishedPorts(const std::string& szRuleset) {
     std::vector<Listener> rgFound;
-    Json::Value js;
-    const std::unique_ptr<Json::CharReader> pReader(Json::CharReaderBuilder().newCharReader());
-    if (!pReader->parse(szRuleset.data(), szRuleset.data() + szRuleset.size(), &js, nullptr) || !js.isObject() ||
-        !js["nftables"].isArray()) {
+    const auto js = ReadJson(szRuleset);
+    if (!js || !js->isObject() || !(*js)["nftables"].isArray()) {
         return rgFound;
     }
     const std::string szOutwards = OutwardAddress();
-    for (const Json::Value& jsItem : js["nftables"]) {
+    for (const Json::Value& jsItem : (*js)["nftables"]) {
         if (!jsItem.isObject() || !jsItem["rule"].isObject()) {
             continue;
         }

@@ -76,10 +76,6 @@ const char* Remedy(const Published& published) {
 
 }  // namespace
 
-std::string Count(int64_t nCount, const std::string& szWhat) {
-    return nCount <= 0 ? fmt::format("no {}s", szWhat) : fmt::format("{} {}{}", nCount, szWhat, nCount == 1 ? "" : "s");
-}
-
 std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSince) {
     auto published = ReadPublished(ProgramOf(router));
     return published && published->nAt >= nSince ? published : std::nullopt;
@@ -136,15 +132,13 @@ Reply OutcomeOf(const Published& published, const Rules& rules, const std::strin
     reply.enExit = nNot + nLeft > 0 ? kRefused : kOk;
     const std::string szOthers =
         nNot == published.rgRules.size() ? "and no other one is asked for" : "the others are in force";
-    reply.szMessage = nNot > 0 ? fmt::format("{} not open on the router; {}. {}",
-                                             Count(static_cast<int64_t>(nNot), "port"), szOthers, Remedy(published))
-                      : nLeft > 0
-                          ? fmt::format("{} could not be taken away from the router yet; {}",
-                                        Count(static_cast<int64_t>(nLeft), "port"),
-                                        published.szProtocol == "pages" ? "the next 'tavoportmap save' tries again"
-                                                                        : "the daemon goes on trying")
-                      : nOn == 0 ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
-                                 : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
+    reply.szMessage =
+        nNot > 0    ? fmt::format("{} not open on the router; {}. {}", Count(nNot, "port"), szOthers, Remedy(published))
+        : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; {}", Count(nLeft, "port"),
+                                  published.szProtocol == "pages" ? "the next 'tavoportmap save' tries again"
+                                                                  : "the daemon goes on trying")
+        : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
+                    : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
     return reply;
 }
 

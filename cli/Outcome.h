@@ -22,7 +22,4 @@ std::string WhoHas(const PublishedRule& rule);
 // What is so now that rules have been saved.
 Reply OutcomeOf(const Published& published, const Rules& rules, const std::string& szGateway);
 
-// "1 rule", "no rules"; never a negative number.
-std::string Count(int64_t nCount, const std::string& szWhat);
-
 }  // namespace tavo::cli

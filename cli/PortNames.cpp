@@ -85,8 +85,10 @@ std::optional<PortWish> ReadPreset(const std::string& szName) {
 std::optional<PortWish> ReadService(const std::string& szName, const std::string& szProtocol) {
     for (const std::string& szTried :
          szProtocol.empty() ? std::vector<std::string>{"tcp", "udp"} : std::vector<std::string>{szProtocol}) {
-        if (const servent* pService = getservbyname(szName.c_str(), szTried.c_str())) {
-            return PortWish{szName, std::to_string(ntohs(static_cast<uint16_t>(pService->s_port))), szTried};
+        const servent* pService = getservbyname(szName.c_str(), szTried.c_str());
+        const uint16_t nPort = pService == nullptr ? 0 : ntohs(static_cast<uint16_t>(pService->s_port));
+        if (nPort != 0) {
+            return PortWish{szName, std::to_string(nPort), szTried};
         }
     }
     return std::nullopt;

@@ -42,18 +42,16 @@ void Progress::Show(int nPercent, const std::string& szStep) {
         const std::string szLine =
             fmt::format("[{:#<{}}{:{}}] {:>3} %  {}", "", nDone, "", kBarCells - nDone, nPercent, szStep);
         // A line that wraps could not be redrawn.
-        fmt::print(stderr, "\r{}\x1b[K", szLine.substr(0, WidthOf(STDERR_FILENO) - 1));
+        Tell("\r" + szLine.substr(0, WidthOf(STDERR_FILENO) - 1) + "\x1b[K");
         mBlOpen = true;
     } else {
-        fmt::print(stderr, "{:>3} %  {}\n", nPercent, szStep);
+        Tell(fmt::format("{:>3} %  {}\n", nPercent, szStep));
     }
-    std::fflush(stderr);
 }
 
 void Progress::End() {
     if (mBlOpen) {
-        fmt::print(stderr, "\n");
-        std::fflush(stderr);
+        Tell("\n");
         mBlOpen = false;
     }
 }

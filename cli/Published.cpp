@@ -2,7 +2,6 @@
 #include "Published.h"
 
 #include <fcntl.h>
-#include <json/json.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -10,8 +9,9 @@
 #include <array>
 #include <fstream>
 #include <iterator>
-#include <memory>
 #include <string_view>
+
+#include "JsonText.h"
 
 namespace tavo::cli {
 
@@ -20,7 +20,6 @@ namespace {
 constexpr off_t kMostBytes = 32 << 20;      // every port of both protocols, with room for words
 constexpr size_t kMostText = 1023;          // bytes of one text; the rest is dropped
 constexpr size_t kMostEntries = 2 * 65536;  // ports of both protocols
-constexpr int kMostDepth = 8;
 constexpr int kMostPort = 65535;
 constexpr char kPagesProgram[] = "tavoportforward";
 constexpr std::array<const char*, 4> kStates = {"unknown", "open", "refused", "waiting"};
@@ -69,23 +68,6 @@ std::optional<std::string> ReadRootsFile(const std::string& szName) {
         nRead += static_cast<size_t>(nMore);
     }
     return szText;
-}
-
-std::optional<Json::Value> Parse(const std::string& szText) {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    builder["stackLimit"] = kMostDepth;
-    const std::unique_ptr<Json::CharReader> pReader(builder.newCharReader());
-    Json::Value js;
-    std::string szErrors;
-    try {
-        if (pReader->parse(szText.data(), szText.data() + szText.size(), &js, &szErrors) && js.isObject()) {
-            return js;
-        }
-    } catch (const Json::Exception&) {
-        // deeper than any file of ours
-    }
-    return std::nullopt;
 }
 
 // ---- members, each of them what it should be or nothing ---------------------------------------------------
@@ -180,8 +162,8 @@ bool IsProgram(pid_t nPid, const std::string& szProgram) {
 
 std::optional<Published> ReadPublished(const std::string& szProgram) {
     const auto szText = ReadRootsFile(szProgram + ".json");
-    const auto js = szText ? Parse(*szText) : std::nullopt;
-    if (!js) {
+    const auto js = szText ? ReadJson(*szText) : std::nullopt;
+    if (!js || !js->isObject()) {
         return std::nullopt;
     }
     Published published = FromJson(*js);

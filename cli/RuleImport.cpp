@@ -5,8 +5,8 @@
 
 #include <algorithm>
 #include <functional>
-#include <memory>
 
+#include "JsonText.h"
 #include "PortNames.h"
 #include "PortPairs.h"
 #include "Usage.h"
@@ -99,13 +99,21 @@ std::string FaultOf(const Rule& rule) {
                                Clean(szPorts));
         }
     }
-    const size_t nRouter = ParsePorts(rule.szRouterPorts)->size();
+    std::vector<int> rgRouter = *ParsePorts(rule.szRouterPorts);
     const size_t nBox = ParsePorts(rule.szBoxPorts)->size();
-    if (nRouter != nBox) {
-        return fmt::format("{} router ports but {} box ports: each router port needs one box port", nRouter, nBox);
+    if (rgRouter.size() != nBox) {
+        return fmt::format("{} router ports but {} box ports: each router port needs one box port", rgRouter.size(),
+                           nBox);
+    }
+    std::sort(rgRouter.begin(), rgRouter.end());
+    if (const auto pTwice = std::adjacent_find(rgRouter.begin(), rgRouter.end()); pTwice != rgRouter.end()) {
+        return fmt::format("router port {} is named twice, and can lead to one port only", *pTwice);
     }
     if (rule.szProtocol != "tcp" && rule.szProtocol != "udp" && rule.szProtocol != "all") {
         return fmt::format("'{}' is none of tcp, udp, all", Clean(rule.szProtocol));
+    }
+    if (rule.szName.find('\0') != std::string::npos || rule.szServiceId.find('\0') != std::string::npos) {
+        return "a name cannot hold a NUL character";
     }
     const size_t nLongest =
         std::max({rule.szRouterPorts.size(), rule.szBoxPorts.size(), rule.szName.size(), rule.szServiceId.size()});
@@ -116,14 +124,13 @@ std::string FaultOf(const Rule& rule) {
 }
 
 std::optional<Rules> ReadImport(const std::string& szText, std::string& szFault) {
-    Json::Value js;
     std::string szErrors;
-    const std::unique_ptr<Json::CharReader> pReader(Json::CharReaderBuilder().newCharReader());
-    if (!pReader->parse(szText.data(), szText.data() + szText.size(), &js, &szErrors)) {
-        szFault = "this is no JSON document: " + Clean(szErrors.substr(0, szErrors.find('\n')));
+    const auto js = ReadJson(szText, &szErrors);
+    if (!js) {
+        szFault = "this is no JSON document that can be taken: " + Clean(szErrors);
         return std::nullopt;
     }
-    const Json::Value& jsRules = js.isObject() ? js["rules"] : js;
+    const Json::Value& jsRules = js->isObject() ? (*js)["rules"] : *js;
     if (!jsRules.isArray()) {
         szFault = "there is no list of rules in this document, neither by itself nor under \"rules\"";
         return std::nullopt;

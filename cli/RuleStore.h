@@ -4,7 +4,6 @@
 // somebody else changes rule.conf meanwhile, nor is what they changed.
 #pragma once
 
-#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
@@ -53,6 +52,8 @@ std::optional<Rules> LoadOff();
 inline bool IsOff() {
     return LoadOff().has_value();
 }
+// No rule is on, and what 'off' noted cannot be read.
+bool IsOffUnreadable();
 bool StoreOff(const Rules& rules);
 bool DropOff();
 

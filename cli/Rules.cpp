@@ -5,9 +5,8 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <fstream>
-#include <iostream>
-#include <iterator>
+#include <cstdlib>
+#include <set>
 
 #include "Box.h"
 #include "Commands.h"
@@ -15,6 +14,7 @@
 #include "RuleImport.h"
 #include "RuleStore.h"
 #include "Table.h"
+#include "TextFile.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -47,11 +47,13 @@ void WarnOfOverlaps(const Rules& rules, Reply& reply) {
     }
 }
 
-// The enabled rule that already wants one of the ports of the rule szId.
-std::string FaultOfOverlap(const Rules& rules, const std::string& szId) {
+// The enabled rule that already wants one of the ports of the rules setIds.
+std::string FaultOfOverlap(const Rules& rules, const std::set<std::string>& setIds) {
     for (const Overlap& overlap : OverlapsOf(rules)) {
-        if (overlap.szLater == szId || overlap.szEarlier == szId) {
-            const std::string& szOther = overlap.szLater == szId ? overlap.szEarlier : overlap.szLater;
+        if (setIds.count(overlap.szLater) + setIds.count(overlap.szEarlier) > 0) {
+            const std::string& szOther = setIds.count(overlap.szEarlier) == 0 || setIds.count(overlap.szLater) != 0
+                                             ? overlap.szEarlier
+                                             : overlap.szLater;
             return fmt::format(
                 "rule {} already forwards router port {}; choose another one, or 'rules remove {}', or add --force",
                 Clean(szOther), overlap.szPort, Clean(szOther));
@@ -92,7 +94,7 @@ Reply AddRule(Rule rule, bool blForce) {
         rule.szId = NextId(rules);
         Rules rulesNew = rules;
         rulesNew.push_back(rule);
-        if (const std::string szFault = FaultOfOverlap(rulesNew, rule.szId); !szFault.empty() && !blForce) {
+        if (const std::string szFault = FaultOfOverlap(rulesNew, {rule.szId}); !szFault.empty() && !blForce) {
             return {.enExit = kUsage, .szMessage = szFault};
         }
         rules = rulesNew;
@@ -112,17 +114,18 @@ Reply ChangeRule(const std::string& szWhich, bool blForce, const std::function<s
         }
         Rules rulesNew = rules;
         Rule& rule = rulesNew[choice.nRule];
-        const std::string szId = rule.szId;
+        const std::string szId = rule.szId, szName = Clean(szId + (rule.szName.empty() ? "" : " " + rule.szName));
         if (blRemove) {
             rulesNew.erase(rulesNew.begin() + static_cast<std::ptrdiff_t>(choice.nRule));
         } else if (const std::string szFault = fnEdit(rule); !szFault.empty()) {
             return {.enExit = kUsage, .szMessage = szFault};
-        } else if (const std::string szOverlap = FaultOfOverlap(rulesNew, szId);
+        } else if (const std::string szOverlap = FaultOfOverlap(rulesNew, {szId});
                    rule.blEnabled && !blForce && !szOverlap.empty()) {
             return {.enExit = kUsage, .szMessage = szOverlap};
         }
         rules = rulesNew;
-        Reply reply{.szMessage = fmt::format("noted, {}", kNext)};
+        Reply reply{.szMessage =
+                        fmt::format("{} of rule {} noted, {}", blRemove ? "removal" : "change", szName, kNext)};
         reply.jsAnswer["id"] = szId;
         return reply;
     });
@@ -209,29 +212,31 @@ Reply Discard() {
 }
 
 Reply Import(const std::string& szPath, bool blReplace, bool blForce) {
-    std::ifstream file(szPath);
-    std::istream& stream = szPath == "-" ? std::cin : file;
-    const std::string szText(std::istreambuf_iterator<char>(stream), {});
-    if (!stream.good() && !stream.eof()) {
-        return {.enExit = kFailed, .szMessage = fmt::format("{} cannot be read", Clean(szPath))};
+    const auto szText = ReadUsersFile(szPath);
+    if (!szText) {
+        return {.enExit = kFailed,
+                .szMessage = fmt::format("'{}' cannot be read, or is too long to be rules", Clean(szPath))};
     }
     std::string szFault;
-    const auto imported = ReadImport(szText, szFault);
+    const auto imported = ReadImport(*szText, szFault);
     if (!imported) {
         return {.enExit = kUsage, .szMessage = szFault + "\nNothing was changed"};
     }
     return ChangeRules([&](Rules& rules) -> Reply {
         Rules rulesNew = blReplace ? Rules() : rules;
+        std::set<std::string> setIds;
+        int nId = std::atoi(NextId(rulesNew).c_str());
         for (Rule rule : *imported) {
-            rule.szId = NextId(rulesNew);
+            rule.szId = std::to_string(nId++);
+            setIds.insert(rule.szId);
             rulesNew.push_back(rule);
-            const std::string szOverlap = blForce ? "" : FaultOfOverlap(rulesNew, rule.szId);
-            if (!szOverlap.empty()) {
-                return {.enExit = kUsage, .szMessage = szOverlap + "\nNothing was changed"};
-            }
+        }
+        const std::string szOverlap = blForce ? "" : FaultOfOverlap(rulesNew, setIds);
+        if (!szOverlap.empty()) {
+            return {.enExit = kUsage, .szMessage = szOverlap + "\nNothing was changed"};
         }
         rules = rulesNew;
-        Reply reply{.szMessage = fmt::format("{} rules noted, {}", imported->size(), kNext)};
+        Reply reply{.szMessage = fmt::format("{} noted, {}", Count(imported->size(), "rule"), kNext)};
         reply.jsAnswer["imported"] = static_cast<Json::UInt>(imported->size());
         return reply;
     });

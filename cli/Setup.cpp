@@ -2,6 +2,7 @@
 #include "Setup.h"
 
 #include <fmt/format.h>
+#include <unistd.h>
 
 #include <algorithm>
 
@@ -14,14 +15,15 @@
 #include "RuleStore.h"
 #include "Settings.h"
 #include "StoredRouter.h"
+#include "Table.h"
 
 namespace tavo::cli {
 
 namespace {
 
 constexpr char kIntroduction[] =
-    "A router lets connections out of the home network and answers back in, but turns away those that\n"
-    "begin outside. Now it is found out how this box can tell it to let single ones through.\n\n";
+    "A router lets connections out of the home network and answers back in, but turns away those that begin outside. "
+    "Now it is found out how this box can tell it to let single ones through.\n\n";
 
 // What NAT-PMP does not say: the router is remembered under it where UPnP does not say it either.
 constexpr char kNoBrand[] = "unknown";
@@ -286,7 +288,7 @@ Reply Setup(const SetupWish& wish, bool blJson) {
         return NoGateway();
     }
     if (!blJson) {
-        fmt::print(stderr, "{}", kIntroduction);
+        Tell(Wrap(kIntroduction, WidthOf(STDERR_FILENO)));
     }
     Reply reply = Finder(wish, blJson, *szGateway).Run();
     if (reply.enExit == kOk && wish.blOffer) {

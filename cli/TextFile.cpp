@@ -7,6 +7,8 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <fstream>
+#include <iostream>
 
 namespace tavo::cli {
 
@@ -71,6 +73,15 @@ ReadState ReadOwnFile(const std::string& szPath, std::string& szText) {
     return read(file.Fd(), szText.data(), szText.size()) == status.st_size ? ReadState::kRead : ReadState::kUnreadable;
 }
 
+std::optional<std::string> ReadUsersFile(const std::string& szPath) {
+    std::ifstream file(szPath);
+    std::istream& stream = szPath == "-" ? std::cin : file;
+    std::string szText(kMostBytes + 1, '\0');
+    stream.read(szText.data(), kMostBytes + 1);
+    szText.resize(static_cast<size_t>(stream.gcount()));
+    return stream.eof() && !stream.bad() ? std::optional(szText) : std::nullopt;
+}
+
 bool WriteOwnFile(const std::string& szPath, const std::string& szText) {
     const std::string szNew = szPath + ".new";
     unlink(szNew.c_str());  // of a writer that was killed
@@ -88,7 +99,8 @@ bool WriteOwnFile(const std::string& szPath, const std::string& szText) {
 }
 
 bool RemoveOwnFile(const std::string& szPath) {
-    const bool blGone = unlink(szPath.c_str()) == 0 || errno == ENOENT;
+    const bool blGone = unlink(szPath.c_str()) == 0 || errno == ENOENT ||
+                        (errno == EISDIR && std::rename(szPath.c_str(), (szPath + ".aside").c_str()) == 0);
     FlushDirectoryOf(szPath);
     return blGone;
 }

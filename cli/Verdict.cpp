@@ -155,7 +155,8 @@ Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, i
                            ? "the router's description is newer than the tool that carries it out; update the tool "
                              "(/usr/tavo/bin/tavoportforward). The old settings are still there"
                            : "the settings could not be stored; the old ones are still there, and the system log says "
-                             "why" + std::string(blDaemon ? "" : kDescribed));
+                             "why" +
+                                 std::string(blDaemon ? "" : kDescribed));
     }
     if (!blDaemon) {
         DropAccount();

@@ -1,15 +1,19 @@
 // tavoportmap: the port-forwarding rules of this box and the router that they go to, for people and scripts.
 // Relies on the library's public header; CLI11 reads the arguments, fmt and jsoncpp write the answers.
 // Promises: one answer, also to wrong arguments; exit codes as in --help.
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <csignal>
 #include <exception>
 #include <iterator>
 #include <string_view>
 #include <utility>
 
 #include "Commands.h"
-#include "Setup.h"
 #include "Completions.h"
+#include "Setup.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -107,6 +111,19 @@ Reply Answer(int argc, char** argv, Request& request) {
     return request.fnCommand();
 }
 
+// Whoever starts the tool without standard input, output or error gets /dev/null there: the next file opened, a lock or
+// the rules, would stand in its place and get what is printed. And a reader that goes away ends no save in its midst.
+void PrepareStreams() {
+    while (true) {
+        const int fd = open("/dev/null", O_RDWR);
+        if (fd < 0 || fd > STDERR_FILENO) {
+            close(fd);
+            break;
+        }
+    }
+    signal(SIGPIPE, SIG_IGN);
+}
+
 }  // namespace
 
 CLI::App* AddCommand(CLI::App& app, const std::string& szName, const std::string& szWhat) {
@@ -119,6 +136,7 @@ CLI::App* AddCommand(CLI::App& app, const std::string& szName, const std::string
 
 int main(int argc, char** argv) {
     using namespace tavo::cli;
+    PrepareStreams();
     Request request;
     request.blJson = AsksForJson(argc, argv);
     try {

@@ -155,6 +155,8 @@ class Tool(unittest.TestCase):
 
     def test_rules_round_trip(self):
         self.expect("rules list", OK, "no rules are stored yet; 'tavoportmap open 443' (?s:.)*rules add web")
+        with open("/etc/services", "a", encoding="utf-8") as services:
+            services.write("zero 0/tcp\n")
         self.expect("rules add web --router-port 443 --box-port 8443", OK, "rule 1 noted, not in force yet")
         self.expect("rules add --name dns --protocol all --router-port 53,5000-5001 --disabled", OK, "rule 2 noted")
         self.expect("rules add --router-port 443", USAGE, "rule 1 already forwards router port 443/tcp")
@@ -165,7 +167,7 @@ class Tool(unittest.TestCase):
         self.expect("rules enable dns", OK, "noted")
         for which, code, pattern in (("3", OK, "noted"), ("3", USAGE, "there is no rule 3; the rules are 1, 2, 4"),
                                      ("450", USAGE, "rule 4 forwards more than '450'(?s:.)*tavoportmap close 450"),
-                                     ("http", USAGE, "there is no rule http")):
+                                     ("http", USAGE, "there is no rule http"), ("zero", USAGE, "there is no rule zero")):
             self.expect(f"rules remove {which}", code, pattern)
         self.assertEqual(self.rows(), [("1", True, "tcp", "443", "8443", "web"),
                                        ("2", True, "all", "53,5000-5001", "53,5000-5001", "dns"),
@@ -250,6 +252,15 @@ class Tool(unittest.TestCase):
         with open("/dev/full", "w", encoding="utf-8") as full:
             self.assertEqual(subprocess.run([TOOL, "rules", "list"], stdout=full, check=False).returncode, FAILED)
 
+    def test_a_reader_that_goes_away_ends_no_save(self):
+        for port, streams in enumerate(("2>/dev/full", "2>&-", ">&- 2>&- <&-", "2> >(exec true)"), 80):
+            tool("rules", "add", "--router-port", str(port))
+            put(ROUTER, KNOWN % ("yes", "no"))
+            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
+            run = subprocess.run(["bash", "-c", f"sleep .1; {TOOL} save {streams}"], env={**os.environ, **WRITES}, check=False, capture_output=True)
+            self.assertEqual((run.returncode, str(port) in [rule["router_ports"] for rule in self.in_force()]),
+                             (OK, True), streams)
+
     # ---- drafts -----------------------------------------------------------------------------------
 
     def test_edits_and_changes_by_others_come_together(self):
@@ -301,11 +312,14 @@ class Tool(unittest.TestCase):
         put(ROUTER, KNOWN % ("yes", "no"))
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nmax="1"\n')
         self.expect("save", TOO_MANY, "Nothing was changed(?s:.)*The edits stay noted")
-        put(DRAFT, "{}")
-        for arguments in ("rules list", "rules add --router-port 91", "save", "rules export"):
-            self.expect(arguments, FAILED, "edits that are not saved yet cannot be read .*'tavoportmap rules discard'")
-        self.assertEqual(get(DRAFT), "{}")
-        self.expect("rules discard", OK, "the edits are dropped")
+        for damage in (lambda: put(DRAFT, "{}"), lambda: put(DRAFT, '{"base":' + "[" * 9000), lambda: put(DRAFT, ""),
+                       lambda: os.makedirs(f"{DRAFT}/x"), lambda: os.symlink(RULES, DRAFT)):
+            os.path.exists(DRAFT) and os.unlink(DRAFT)
+            damage()
+            for arguments in ("rules list", "rules add --router-port 91", "save", "rules export"):
+                self.expect(arguments, FAILED, "edits that are not saved yet cannot be read .*'tavoportmap rules discard'")
+            self.assertTrue(os.path.exists(DRAFT))
+            self.expect("rules discard", OK, "the edits are dropped")
         self.expect("rules discard", OK, "nothing to drop")
         self.assertEqual([row[0] for row in self.rows()], ["7", "9"])
 
@@ -338,6 +352,9 @@ class Tool(unittest.TestCase):
                               ('[{"router_ports": "1-2", "box_ports": "1"}]', "2 router ports but 1 box ports"),
                               ('[{"router_ports": 1, "protocol": "sctp"}]', "none of tcp, udp, all"),
                               ('[{"router_ports": 1, "enabled": "no"}]', "neither true nor false"),
+                              ("[" * 9000, "nested too deeply"), ('[{"router_ports": 1, "router_ports": 2}]', "Duplicate key"),
+                              ('[{"router_ports": 1, "name": "a\\u0000b"}]', "NUL"),
+                              ('[{"router_ports": "5,6,5", "box_ports": "1-3"}]', "router port 5 is named twice"),
                               ('[{"router_ports": 99}, {"router_ports": 443}]', "rule 7 already forwards router port 443/tcp")):
             put("/tmp/rules.json", text)
             self.expect("rules import /tmp/rules.json", USAGE, f"{pattern}(?s:.)*Nothing was changed")
@@ -346,7 +363,8 @@ class Tool(unittest.TestCase):
         self.assertEqual((code, self.rows()[2]), (OK, ("9", True, "tcp", "99", "99", "")), out + err)
         self.assertEqual(tool("rules", "import", "--replace", "-", stdin=document)[0], OK)
         self.assertEqual([row[1:] for row in self.rows()], [row[1:] for row in rules])
-        self.expect("rules import /tmp/nothing", FAILED, "cannot be read")
+        for path in ("/tmp/nothing", "/tmp", "/dev/zero"):
+            self.expect(f"rules import {path}", FAILED, f"'{path}' cannot be read")
 
     # ---- one command ------------------------------------------------------------------------------
 
@@ -372,6 +390,7 @@ class Tool(unittest.TestCase):
                                                            (1, "udp", "5000-5001,5003-5004", "5000-5001,5003-5004", ""))),
                 ((span,), "close 5000-5002", OK, "closed", ((1, "all", "5003-5004", "5003-5004", ""),)),
                 ((off(web),), "close 443", OK, "nothing to close", (off(web),)),
+                (((1, "tcp", "80", "80", "443"), web), "close 443", OK, "443 closed", ((1, "tcp", "80", "80", "443"),)),
                 ((web,), "close wbe", USAGE, "neither a port nor the name of a rule", (web,)),
                 ((off(web),), "off", OK, "nothing to switch off", (off(web),)),
                 ((web,), "on", OK, "nothing to switch on", (web,))):
@@ -397,6 +416,10 @@ class Tool(unittest.TestCase):
         for command in ("open 92", "save", "service set hoplink 80/tcp"):
             self.expect(command, FAILED, "every port is switched off(?s:.)*tavoportmap on", **WRITES)
         self.expect("off", OK, "switched off already", **WRITES)
+        noted = get(OFF)
+        put(OFF, '{"rules":' + "[" * 9000)
+        self.expect("on", FAILED, "cannot be read .*rules.off.*'tavoportmap rules enable RULE'", **WRITES)
+        put(OFF, noted)
         self.expect("on", OK, "2 rules in force", **WRITES)
         self.assertEqual([(rule["name"], rule["enabled"]) for rule in self.in_force()],
                          [("web", True), ("never", False), ("dns", True)])
