@@ -10,7 +10,7 @@ import unittest
 
 import homelab
 import networks
-from homelab import BOX, BUILD, GATEWAY, wait_for
+from homelab import BOX, BUILD, GATEWAY, sh, wait_for
 
 LAB = OUTSIDE = None
 TOOL = f"{BUILD}/cli/tavoportmap"
@@ -46,14 +46,17 @@ def is_free():
 def little_space(path):
     """The directory with what it holds, on a file system that is full."""
     copy = subprocess.run(["tar", "-cC", path, "."], check=False, capture_output=True).stdout  # not what nobody may read
-    subprocess.run(["mount", "-t", "tmpfs", "-o", "size=64m", "tmpfs", path], check=True)
-    try:
+    def mount(size):
+        subprocess.run(["mount", "-t", "tmpfs", "-o", f"size={size}", "tmpfs", path], check=True)
         subprocess.run(["tar", "--no-same-owner", "-xC", path], input=copy, check=True)
-        used = subprocess.run(["df", "--output=used", "-k", path], check=True, capture_output=True, text=True).stdout
-        subprocess.run(["mount", "-o", f"remount,size={int(used.split()[1])}k", path], check=True)
+    mount("64m")
+    used = sh(f"df --output=used -k {path}").stdout.split()[1]
+    sh(f"umount {path}")
+    mount(f"{used}k")
+    try:
         yield
     finally:
-        subprocess.run(["umount", path], check=True)
+        sh(f"umount {path}")
 
 
 class Keys(unittest.TestCase):
