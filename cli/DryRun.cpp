@@ -7,46 +7,34 @@
 #include <map>
 
 #include "Box.h"
-#include "Outcome.h"
+#include "LiveTable.h"
 #include "PortPairs.h"
+#include "Published.h"
 #include "SaveRules.h"
 #include "StoredRouter.h"
+#include "Table.h"
 #include "tavo/net.h"
-#include "tavo/upnp.h"
 
 namespace tavo::cli {
 
 namespace {
 
-constexpr int kSearchSeconds = 6;
-constexpr int kLocalPort = 55003;
 constexpr size_t kAddressSize = 64;
-constexpr int kMostEntries = 65536;
 
-// The router's table by "443/tcp"; nothing where it cannot be read.
+// The router's table and this box's address in it; nothing where it cannot be read.
 struct RouterTable {
-    std::map<std::string, TAVO_UPNP_PORT_MAPPING> mapEntries;
+    LiveTable live;
     std::string szBox;
 };
 
 std::optional<RouterTable> ReadTable(const StoredRouter& router, const std::string& szGateway) {
     char szBox[kAddressSize] = {};
     if (router.enWay != Way::kUpnp ||
-        TAVONetLocalAddressGet(szGateway.c_str(), szBox, sizeof(szBox), nullptr, 0) != 0 ||
-        TAVOUpnpInit(kSearchSeconds, kLocalPort) != 0) {
+        TAVONetLocalAddressGet(szGateway.c_str(), szBox, sizeof(szBox), nullptr, 0) != 0) {
         return std::nullopt;
     }
-    RouterTable table{.mapEntries = {}, .szBox = szBox};
-    TAVO_UPNP_PORT_MAPPING mapping = {};
-    for (int i = 0; i < kMostEntries && TAVOUpnpPortMappingGet(i, &mapping) == 0; ++i) {
-        const std::string szProtocol = mapping.szProtocol;
-        if (mapping.nEnabled != 0 && !szProtocol.empty()) {
-            table.mapEntries.emplace(std::to_string(mapping.nExternalPort) + (szProtocol == "UDP" ? "/udp" : "/tcp"),
-                                     mapping);
-        }
-    }
-    TAVOUpnpCleanup();
-    return table;
+    auto live = ReadLiveTable();
+    return live ? std::optional(RouterTable{std::move(*live), szBox}) : std::nullopt;
 }
 
 struct Fate {
@@ -85,14 +73,11 @@ Wanted WantedBy(const Rules& rules) {
 }
 
 // Another device that the router's table gives this port to.
-std::string Holder(const std::optional<RouterTable>& table, const std::string& szPort) {
-    const auto it = table ? table->mapEntries.find(szPort) : decltype(table->mapEntries.end()){};
-    if (!table || it == table->mapEntries.end() || it->second.szInternalClient == table->szBox) {
-        return "";
-    }
-    const std::string szDescription = Clean(it->second.szDescription);
-    return fmt::format("another device has it on the router ({}{}{})", Clean(it->second.szInternalClient),
-                       szDescription.empty() ? "" : ", ", szDescription);
+std::string Holder(const std::optional<RouterTable>& table, const std::pair<std::string, int>& key) {
+    const auto entry = table ? table->live.Find(key.second, key.first) : std::nullopt;
+    return !entry || !entry->blEnabled || entry->szClient == table->szBox
+               ? ""
+               : "another device has it on the router" + WhoHas(PublishedHolder{entry->szClient, entry->szDescription});
 }
 
 Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const Wanted& after,
@@ -104,7 +89,7 @@ Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const 
     }
     const std::string szTo =
         itAfter->second == key.second ? "" : fmt::format("to port {} of this box", itAfter->second);
-    if (const std::string szHolder = Holder(table, fmt::format("{}/{}", key.second, key.first)); !szHolder.empty()) {
+    if (const std::string szHolder = Holder(table, key); !szHolder.empty()) {
         return {"refuse", szTo, szHolder};
     }
     if (const auto itDouble = after.mapDoubles.find(key); itDouble != after.mapDoubles.end()) {
@@ -116,10 +101,10 @@ Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const 
             szTo, ""};
 }
 
-void AddLine(const std::string& szProtocol, int nFirst, int nLast, const Fate& fate, Reply& reply) {
+void AddLine(const std::string& szProtocol, int nFirst, int nLast, const Fate& fate, Table& text, Reply& reply) {
     const std::string szPorts = nFirst == nLast ? std::to_string(nFirst) : fmt::format("{}-{}", nFirst, nLast);
     const std::string szMore = fate.szWhat + (fate.szWhat.empty() || fate.szWhy.empty() ? "" : ": ") + fate.szWhy;
-    reply.szBody += fmt::format("{:<8}{:<16}{}\n", fate.szAction, szPorts + "/" + szProtocol, szMore);
+    text.Add({fate.szAction, szPorts + "/" + szProtocol, szMore});
     Json::Value js;
     js["action"] = fate.szAction;
     js["router_ports"] = szPorts;
@@ -138,6 +123,7 @@ bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<Rou
         }
     }
     bool blRefused = false;
+    Table text({"would", "port", ""});
     for (auto it = mapFates.begin(); it != mapFates.end();) {
         const auto& [szProtocol, nFirst] = it->first;
         const Fate& fate = it->second;
@@ -145,9 +131,10 @@ bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<Rou
         for (++it; it != mapFates.end() && it->first == std::pair(szProtocol, nLast + 1) && it->second == fate; ++it) {
             ++nLast;
         }
-        AddLine(szProtocol, nFirst, nLast, fate, reply);
+        AddLine(szProtocol, nFirst, nLast, fate, text, reply);
         blRefused = blRefused || fate.szAction == "refuse";
     }
+    reply.szBody += text.ToText();
     return blRefused;
 }
 

@@ -2,6 +2,7 @@
 // test from outside. Promises: only this port is opened, whatever edits are waiting; what was not looked at is not
 // called open; a port that should not face the world is not opened without a word.
 #include <fmt/format.h>
+#include <unistd.h>
 
 #include <algorithm>
 
@@ -16,6 +17,8 @@
 #include "RuleImport.h"
 #include "SaveRules.h"
 #include "Setup.h"
+#include "Situation.h"
+#include "Table.h"
 #include "Test.h"
 #include "Usage.h"
 #include "tavo/core.h"
@@ -183,19 +186,27 @@ void AddOutside(const Rule& rule, bool blJson, Reply& reply) {
         reply.jsAnswer["address"] = AddressToTry(rule, szOutside);
         reply.szBody += fmt::format("from outside it is {}\n", Clean(AddressToTry(rule, szOutside)));
     }
+    const std::string szCaveat = ReachCaveat(ReachOf(szOutside));
+    if (!szCaveat.empty()) {
+        reply.rgszWarnings.push_back(
+            fmt::format("the router's address outside is {}, {}. Until then nobody on the Internet reaches the port",
+                        Clean(szOutside), szCaveat));
+    }
+    reply.jsAnswer["outside_kind"] = ToWord(ReachOf(szOutside));
     reply.jsAnswer["tested"] = Json::Value();
     if (!IsCheckerNamed()) {
-        reply.szBody +=
+        reply.szBody += Wrap(
             "try it from elsewhere, such as a phone without Wi-Fi; nobody outside was asked, as no port checker is "
-            "named "
-            "('tavoportmap test --help')\n";
+            "named ('tavoportmap test --help')\n",
+            WidthOf(STDOUT_FILENO));
         return;
     }
     const Reply tested = TestRules({rule}, blJson);
     reply.szBody += tested.szBody;
     reply.rgszWarnings.insert(reply.rgszWarnings.end(), tested.rgszWarnings.begin(), tested.rgszWarnings.end());
     reply.jsAnswer["tested"] = tested.jsAnswer["ports"];
-    if (tested.enExit == kRefused) {
+    const Json::Value& jsPorts = tested.jsAnswer["ports"];  // that nobody listens yet is said already
+    if (std::any_of(jsPorts.begin(), jsPorts.end(), [](const Json::Value& js) { return js["status"] == "fail"; })) {
         reply.enExit = kRefused;
         reply.szMessage += ", but it is closed from outside";
     }

@@ -5,6 +5,8 @@
 
 #include <algorithm>
 
+#include "Table.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -81,21 +83,13 @@ std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSinc
     return published && published->nAt >= nSince ? published : std::nullopt;
 }
 
-std::string WhoHas(const PublishedRule& rule) {
-    if (!rule.holder || rule.holder->szAddress.empty()) {
-        return "";
-    }
-    const std::string szWhat = Clean(rule.holder->szDescription);
-    return fmt::format(" ({}{}{})", Clean(rule.holder->szAddress), szWhat.empty() ? "" : ", ", szWhat);
-}
-
 void AddPorts(const Published& published, bool blAll, Reply& reply) {
+    Table table({"port", "state", ""});
     reply.jsAnswer["ports"] = Json::arrayValue;
     for (const PublishedRule& rule : published.rgRules) {
         const bool blOpen = rule.enState == PortState::kOpen;
         if (blAll || !blOpen) {
-            reply.szBody += fmt::format("{:<12} {}{}{}{}\n", Clean(rule.szName), StateWords(rule),
-                                        rule.szWhy.empty() ? "" : ": ", Clean(rule.szWhy), WhoHas(rule));
+            table.Add({rule.szName, StateWords(rule), Clean(rule.szWhy) + WhoHas(rule.holder)});
         }
         Json::Value js;
         js["name"] = rule.szName;
@@ -108,12 +102,13 @@ void AddPorts(const Published& published, bool blAll, Reply& reply) {
         reply.jsAnswer["ports"].append(js);
     }
     for (const PublishedLeftOver& left : published.rgLeftOver) {
-        reply.szBody += fmt::format("{:<12} still on the router: {}\n", Clean(left.szName), Clean(left.szWhy));
+        table.Add({left.szName, "still on the router", left.szWhy});
         Json::Value js;
         js["name"] = left.szName;
         js["why"] = left.szWhy;
         reply.jsAnswer["left_over"].append(js);
     }
+    reply.szBody += table.ToText();
 }
 
 Reply OutcomeOf(const Published& published, const Rules& rules, const std::string& szGateway) {

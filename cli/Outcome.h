@@ -17,7 +17,6 @@ std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSinc
 
 // "443/tcp refused: another device has this port on the router (192.168.1.7, console)", as a line; and as JSON.
 void AddPorts(const Published& published, bool blAll, Reply& reply);
-std::string WhoHas(const PublishedRule& rule);
 
 // What is so now that rules have been saved.
 Reply OutcomeOf(const Published& published, const Rules& rules, const std::string& szGateway);

@@ -11,6 +11,7 @@
 #include <iterator>
 #include <string_view>
 
+#include "Answer.h"
 #include "JsonText.h"
 
 namespace tavo::cli {
@@ -169,6 +170,14 @@ std::optional<Published> ReadPublished(const std::string& szProgram) {
     Published published = FromJson(*js);
     const bool blAlive = szProgram == kPagesProgram || IsProgram(published.nPid, szProgram);
     return blAlive ? std::optional(std::move(published)) : std::nullopt;
+}
+
+std::string WhoHas(const std::optional<PublishedHolder>& holder) {
+    if (!holder || holder->szAddress.empty()) {
+        return "";
+    }
+    return " (" + Clean(holder->szAddress) + (holder->szDescription.empty() ? "" : ", ") +
+           Clean(holder->szDescription) + ")";
 }
 
 const char* ToWord(PortState enState) {

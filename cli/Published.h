@@ -67,5 +67,7 @@ struct Published {
 std::optional<Published> ReadPublished(const std::string& szProgram);
 
 const char* ToWord(PortState enState);
+// " (192.168.1.7, console)", cleaned; empty where it is not known.
+std::string WhoHas(const std::optional<PublishedHolder>& holder);
 
 }  // namespace tavo::cli

@@ -13,9 +13,6 @@ namespace {
 
 enum Status : int { kNotTested = 0, kDisabled = 1, kOpen = 2, kClosed = 3 };
 
-constexpr char kNobodyListens[] = "no program on this box listens there";
-constexpr char kNoJudge[] = "nobody outside could tell";
-
 constexpr char kAdviceClosed[] =
     "closed from outside: have the rules been written ('tavoportmap save')? Then it is another router on the way "
     "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
@@ -40,13 +37,33 @@ std::vector<std::string> LoggedWords(const std::string& szLog) {
     return rgszWords;
 }
 
-// What the tester said of the rule at this place; empty when it said nothing.
-std::string LoggedReason(const std::string& szLog, size_t nRule) {
+// What the tester said of the rule at this place, without the port where it is the only one; empty when it said
+// nothing.
+std::string LoggedReason(const std::string& szLog, size_t nRule, const PortVerdict& verdict) {
     const std::string szBegin = fmt::format("port test, rule {}: ", nRule + 1);
+    const std::string szPort = fmt::format("{}/{}: ", verdict.szRouterPorts, verdict.szProtocol);
     const size_t nAt = szLog.rfind(szBegin);
-    return nAt == std::string::npos
-               ? ""
-               : Clean(szLog.substr(nAt + szBegin.size(), szLog.find('\n', nAt) - nAt - szBegin.size()));
+    if (nAt == std::string::npos) {
+        return "";
+    }
+    const std::string szReason = szLog.substr(nAt + szBegin.size(), szLog.find('\n', nAt) - nAt - szBegin.size());
+    return Clean(szReason.starts_with(szPort) ? szReason.substr(szPort.size()) : szReason);
+}
+
+// What stands there when the tester said nothing.
+std::string UsualReason(const PortVerdict& verdict) {
+    switch (verdict.enStatus) {
+        case kNotTested:
+            return verdict.blNobodyListens ? "no program on this box listens there" : "nobody outside could tell";
+        case kDisabled:
+            return "the rule is switched off";
+        case kOpen:
+            return "a connection from outside came through to this box";
+        case kClosed:
+            return "refused, without an answer, or another host answers";
+        default:
+            return "the tester gave no verdict that is known";
+    }
 }
 
 std::string PortWords(const PortVerdict& verdict) {
@@ -77,48 +94,34 @@ void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) 
     size_t nWord = 0;
     for (size_t i = 0; i < rgVerdicts.size(); ++i) {
         PortVerdict& verdict = rgVerdicts[i];
-        const std::string szLogged = LoggedReason(szLog, i);
-        switch (verdict.enStatus) {
-            case kNotTested:
-                verdict.szReason = blFits && rgszWords[nWord++] == "NOLISTEN" ? kNobodyListens
-                                   : szLogged.empty()                         ? kNoJudge
-                                                                              : szLogged;
-                break;
-            case kDisabled:
-                verdict.szReason = "the rule is switched off";
-                break;
-            case kOpen:
-                verdict.szReason = "a connection from outside came through to this box";
-                break;
-            case kClosed:
-                verdict.szReason = szLogged.empty() ? "refused, without an answer, or another host answers" : szLogged;
-                break;
-            default:
-                verdict.szReason = "the tester gave no verdict that is known";
-        }
+        verdict.blNobodyListens = verdict.enStatus == kNotTested && blFits && rgszWords[nWord++] == "NOLISTEN";
+        const std::string szLogged = LoggedReason(szLog, i, verdict);
+        // "open" and "the rule is disabled" say less than our own words.
+        const bool blSaysMore = !szLogged.empty() && szLogged != "open" && verdict.enStatus != kDisabled;
+        verdict.szReason = blSaysMore ? szLogged : UsualReason(verdict);
     }
 }
 
 void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply) {
-    bool blClosed = false, blUnjudged = false, blNoJudge = false;
+    bool blClosed = false, blUnserved = false, blUnjudged = false;
     reply.jsAnswer["ports"] = Json::arrayValue;
     Table table({"rule", "port", "verdict", "reason"});
     for (const PortVerdict& verdict : rgVerdicts) {
         const std::string szRule = verdict.szRule + (verdict.szRule.empty() ? "" : " ") + verdict.szName;
-        table.Add({Clean(szRule), PortWords(verdict), StatusWord(verdict.enStatus), verdict.szReason});
+        table.Add({szRule, PortWords(verdict), StatusWord(verdict.enStatus), verdict.szReason});
         reply.jsAnswer["ports"].append(ToJson(verdict));
         blClosed = blClosed || verdict.enStatus == kClosed;
-        blUnjudged = blUnjudged || verdict.enStatus == kNotTested;
-        blNoJudge = blNoJudge || (verdict.enStatus == kNotTested && verdict.szReason != kNobodyListens);
+        blUnserved = blUnserved || verdict.blNobodyListens;
+        blUnjudged = blUnjudged || (verdict.enStatus == kNotTested && !verdict.blNobodyListens);
     }
     reply.szBody += table.ToText();
-    if (blNoJudge) {
+    if (blUnjudged) {
         reply.rgszWarnings.emplace_back(kAdviceNoJudge);
     }
     if (blClosed) {
         reply.rgszWarnings.emplace_back(kAdviceClosed);
     }
-    reply.enExit = blClosed ? kRefused : blUnjudged ? kFailed : kOk;
+    reply.enExit = blClosed || blUnserved ? kRefused : blUnjudged ? kFailed : kOk;
 }
 
 }  // namespace tavo::cli

@@ -16,15 +16,16 @@ struct PortVerdict {
     std::string szRouterPorts;
     std::string szBoxPorts;
     std::string szProtocol;
-    int enStatus = 0;  // as the library writes it: 0 not tested, 1 disabled, 2 ok, 3 fail
-    std::string szReason = {};
+    int enStatus = 0;              // as the library writes it: 0 not tested, 1 disabled, 2 ok, 3 fail
+    bool blNobodyListens = false;  // on this box, so that nobody outside was asked
+    std::string szReason = {};     // in the tester's own words, where it has some
 };
 
 // Gives each verdict its reason. szLog: what the library logged while it tested them, in this order.
 void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog);
 
-// Adds the table and what can be done about it; kRefused when a port is closed, kFailed when one could not be
-// judged.
+// Adds the table and what can be done about it; kRefused when a port is closed or nobody listens there, kFailed when
+// one could not be judged.
 void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply);
 
 }  // namespace tavo::cli

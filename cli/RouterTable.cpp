@@ -79,8 +79,8 @@ Reply RouterTable() {
     reply.jsAnswer["entries"] = Json::arrayValue;
     for (const LiveEntry& entry : live->rgEntries) {
         const std::string szOwner = OwnerWord(situation, entry);
-        table.Add({Clean(entry.Name()), Clean(fmt::format("{}:{}", entry.szClient, entry.nClientPort)), szOwner,
-                   LeaseWords(entry), Clean(entry.szDescription)});
+        table.Add({entry.Name(), fmt::format("{}:{}", entry.szClient, entry.nClientPort), szOwner, LeaseWords(entry),
+                   entry.szDescription});
         Json::Value js = ToJson(entry);
         js["ours"] = szOwner == "ours";
         js["this_box"] = !szOwner.empty();

@@ -19,6 +19,7 @@
 #include "ServicePlan.h"
 #include "Settings.h"
 #include "StoredRouter.h"
+#include "Table.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -158,13 +159,14 @@ std::string Objection(const Wish& wish, const Surroundings& found) {
 // Adds the plan; whether every port that was asked for opens.
 bool Describe(const ServicePlan& plan, Reply& reply) {
     bool blAll = true;
+    Table table({"port or rule", ""});
     for (const char* szMember : {"requests", "changes", "rules_after"}) {
         reply.jsAnswer[szMember] = Json::arrayValue;
     }
     for (const PortFate& fate : plan.rgPorts) {
         blAll = blAll && fate.szWhyNot.empty();
-        reply.szBody += fmt::format("{:<24} {}\n", fate.szPorts + "/" + fate.szProtocol,
-                                    fate.szWhyNot.empty() ? "opens" : "stays out: " + fate.szWhyNot);
+        table.Add(
+            {fate.szPorts + "/" + fate.szProtocol, fate.szWhyNot.empty() ? "opens" : "stays out: " + fate.szWhyNot});
         Json::Value js;
         js["ports"] = fate.szPorts;
         js["protocol"] = fate.szProtocol;
@@ -173,7 +175,7 @@ bool Describe(const ServicePlan& plan, Reply& reply) {
         reply.jsAnswer["requests"].append(js);
     }
     for (const RuleFate& fate : plan.rgRules) {
-        reply.szBody += fmt::format("{:<24} {}\n", "rule " + fate.szRule, fate.szWhat);
+        table.Add({"rule " + fate.szRule, fate.szWhat});
         Json::Value js;
         js["rule"] = fate.szRule;
         js["what"] = fate.szWhat;
@@ -182,6 +184,7 @@ bool Describe(const ServicePlan& plan, Reply& reply) {
     for (const Rule& rule : plan.after) {
         reply.jsAnswer["rules_after"].append(ToJson(rule));
     }
+    reply.szBody += table.ToText();
     return blAll;
 }
 
@@ -276,7 +279,7 @@ Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& sz
     reply.szMessage = !blAll                     ? "some ports that were asked for stay out; the others are in force"
                       : found.rgRequests.empty() ? "the router keeps no port for this service"
                       : reply.enExit == kOk      ? "in force on the router"
-                      : reply.enExit == kRefused ? "in force on the router, but some ports are closed from outside"
+                      : reply.enExit == kRefused ? "in force on the router, but some ports do not answer to the outside"
                                                  : "in force on the router, but some ports could not be judged";
     return reply;
 }
@@ -362,11 +365,6 @@ Reply Set(const Wish& wish, bool blJson) {
 
 // ---- list, detect -----------------------------------------------------------------------------------------
 
-std::string TableRow(const std::string& szService, const std::string& szState, const Rule& rule) {
-    return fmt::format("{:<16} {:<4} {:<8} {:<6} {}\n", szService, Clean(rule.szId), szState, Clean(rule.szProtocol),
-                       Clean(rule.szRouterPorts));
-}
-
 Reply List() {
     auto rules = LoadRules();
     if (!rules) {
@@ -377,12 +375,13 @@ Reply List() {
                      [](const Rule& one, const Rule& other) { return one.szName < other.szName; });
     Reply reply;
     reply.jsAnswer["rules"] = Json::arrayValue;
-    const Rule head{"rule", true, "proto", "ports", "", "", ""};
-    reply.szBody = rules->empty() ? "" : Paint(Ink::kBold, TableRow("service", "state", head), STDOUT_FILENO);
+    Table table({"service", "rule", "state", "proto", "ports"});
     for (const Rule& rule : *rules) {
-        reply.szBody += TableRow(Clean(rule.szName), rule.blEnabled ? "enabled" : "disabled", rule);
+        table.Add(
+            {rule.szName, rule.szId, rule.blEnabled ? "enabled" : "disabled", rule.szProtocol, rule.szRouterPorts});
         reply.jsAnswer["rules"].append(ToJson(rule));
     }
+    reply.szBody = table.ToText();
     reply.szMessage = rules->empty() ? "no rule belongs to a service; 'tavoportmap service set' makes some" : "";
     return reply;
 }

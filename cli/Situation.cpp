@@ -127,6 +127,23 @@ Reach ReachOf(const std::string& szAddress) {
     return blPrivate ? Reach::kPrivate : Reach::kPublic;
 }
 
+const char* ToWord(Reach enReach) {
+    constexpr const char* kWords[] = {"unknown", "public", "private", "carrier"};
+    return kWords[static_cast<size_t>(enReach)];
+}
+
+std::string ReachCaveat(Reach enReach) {
+    switch (enReach) {
+        case Reach::kPrivate:
+            return "which is a private one: another router stands between this one and the Internet, and has to "
+                   "forward the ports, too";
+        case Reach::kCarrier:
+            return "which is the provider's own: nobody outside reaches it; ask the provider for a public address";
+        default:
+            return "";
+    }
+}
+
 Situation LookAround(bool blLive) {
     Situation situation;
     situation.nNow = std::time(nullptr);

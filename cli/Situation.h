@@ -40,6 +40,9 @@ struct StoredRules {
 // or a provider's own (100.64.0.0/10).
 enum class Reach { kUnknown, kPublic, kPrivate, kCarrier };
 Reach ReachOf(const std::string& szAddress);
+const char* ToWord(Reach enReach);
+// What that means for who calls from outside; empty for a public one.
+std::string ReachCaveat(Reach enReach);
 
 struct Situation {
     int64_t nNow = 0;

@@ -113,10 +113,9 @@ Json::Value DetectedJson(const Situation& situation) {
 }
 
 Json::Value OutsideJson(const Situation& situation) {
-    constexpr const char* kReaches[] = {"unknown", "public", "private", "carrier"};
     Json::Value js;
     js["address"] = TextOrNull(situation.Outside());
-    js["kind"] = kReaches[static_cast<int>(ReachOf(situation.Outside()))];
+    js["kind"] = ToWord(ReachOf(situation.Outside()));
     return js;
 }
 

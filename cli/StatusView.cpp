@@ -16,20 +16,8 @@ namespace {
 
 std::string OutsideWords(const Situation& situation) {
     const std::string szOutside = Clean(situation.Outside());
-    switch (ReachOf(szOutside)) {
-        case Reach::kPublic:
-            return szOutside;
-        case Reach::kPrivate:
-            return szOutside +
-                   ", which is a private one: another router stands between this one and the Internet, and "
-                   "has to forward the ports, too";
-        case Reach::kCarrier:
-            return szOutside +
-                   ", which is the provider's own: nobody outside reaches it; ask the provider for a public "
-                   "address";
-        default:
-            return "not known";
-    }
+    const std::string szCaveat = ReachCaveat(ReachOf(szOutside));
+    return ReachOf(szOutside) == Reach::kUnknown ? "not known" : szOutside + (szCaveat.empty() ? "" : ", ") + szCaveat;
 }
 
 // How many address translations a connection from outside would have to pass.
@@ -104,16 +92,8 @@ std::string LiveWords(const Situation& situation) {
     return situation.blAsked ? "does not answer by UPnP" : "";
 }
 
-std::string HolderWords(const std::optional<PublishedHolder>& holder) {
-    if (!holder || holder->szAddress.empty()) {
-        return "";
-    }
-    const std::string szWhat = Clean(holder->szDescription);
-    return fmt::format(": {}{}", Clean(holder->szAddress), szWhat.empty() ? "" : " (" + szWhat + ")");
-}
-
 std::string FactWords(const PortFact& fact, int64_t nNow) {
-    std::string szWords = Clean(fact.szWhy) + HolderWords(fact.holder);
+    std::string szWords = Clean(fact.szWhy) + WhoHas(fact.holder);
     const auto fnAdd = [&szWords](const std::string& szMore) { szWords += (szWords.empty() ? "" : ", ") + szMore; };
     if (fact.nSince) {
         fnAdd("since " + Moment(*fact.nSince, nNow));

@@ -84,7 +84,7 @@ Reply TestParts(const Rules& parts, bool blJson) {
     AddReasons(rgVerdicts, szLog);
     Reply reply;
     DescribePorts(rgVerdicts, reply);
-    reply.szMessage = reply.enExit == kRefused  ? "some ports are closed from outside"
+    reply.szMessage = reply.enExit == kRefused  ? "some ports do not answer to the outside"
                       : reply.enExit == kFailed ? "some ports could not be judged"
                                                 : "every port that is switched on can be reached from outside";
     return reply;

@@ -6,8 +6,8 @@
 
 namespace tavo::cli {
 
-// A row and, as JSON, an entry of "ports" for each port; kRefused when one is closed, kFailed when one could not be
-// judged. Takes the router lock itself.
+// A row and, as JSON, an entry of "ports" for each port; kRefused when one is closed or nobody listens there,
+// kFailed when one could not be judged. Takes the router lock itself.
 Reply TestRules(const Rules& rules, bool blJson);
 
 }  // namespace tavo::cli

@@ -216,7 +216,8 @@ class Tool(unittest.TestCase):
         world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": "0 0 5 2 2 0 -1 10 80", "TAVO_REACH": "2 3 " + "0 NOLISTEN " * 12}
         wide = lambda text: sum(1 + (char >= "\u1100") for char in text)
         for width in (40, 80):
-            for arguments in ((), ("rules", "add", "--help"), ("routers",), ("test",), ("detect",), ("status",), ("rulse",)):
+            for arguments in ((), ("rules", "add", "--help"), ("routers",), ("test",), ("detect",), ("status",), ("rulse",),
+                              ("service", "list"), ("save", "--dry-run")):
                 text = on_terminal(*arguments, COLUMNS=str(width), NO_COLOR="1", **world)[1].replace("\r\n", "\n")
                 text = text.split("\x1b[K\n")[-1]  # what the bar drew is no text
                 for line in text.split("\n"):
@@ -227,7 +228,7 @@ class Tool(unittest.TestCase):
                 whole = re.sub(r"(?m)^ *\d+ %.*\n", "", run.stdout + run.stderr)
                 words = lambda text: [word for word in re.sub(r"[\s,]+", " ", text).split() if not word.endswith("...")]
                 self.assertFalse(set(words(text)) - set(words(whole)), arguments)
-                self.assertLess(len(set(words(whole)) - set(words(text))), 8, arguments)  # of a name that was cut
+                self.assertLess(len(set(words(whole)) - set(words(text))), 10, arguments)  # of a name that was cut
                 for line in run.stdout.split("\n") if arguments == ("test",) else []:
                     self.assertRegex(line, r"^$|^rule |^[12] .* (80\d\d|80|443)/tcp ")  # a row a line, for scripts
 
@@ -403,6 +404,16 @@ class Tool(unittest.TestCase):
             key = lambda rule: (rule["enabled"], rule["protocol"], rule["router_ports"], rule["box_ports"], rule["name"])
             self.assertEqual([key(rule) for rule in self.in_force()], list(after), command)
             self.assertEqual([row[3] for row in self.rows() if row[5] == "unsaved"], ["7777"], "the edit still waits")
+
+    def test_an_address_that_nobody_outside_reaches_is_no_address_to_try(self):
+        pid = self.keep()
+        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        for outside, kind, pattern in (("198.41.0.4", "public", "from outside it is https://198.41.0.4/(?!(?s:.)*nobody on the Internet)"),
+                                       ("192.168.0.9", "private", "warning: .*another router stands(?s:.)*nobody on the Internet"),
+                                       ("100.64.0.9", "carrier", "warning: .*the provider's own(?s:.)*nobody on the Internet")):
+            self.publish(pid, outside=outside)
+            self.expect("open 443 --to 8443", OK, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0 write")
+            self.assertEqual(self.json("open", "443", "--to", "8443", **WRITES)[1]["outside_kind"], kind)
 
     def test_off_is_off_until_on(self):
         put(ROUTER, KNOWN % ("yes", "no"))
@@ -679,6 +690,7 @@ class Tool(unittest.TestCase):
         for answer, code, words in (("2 2 2 2 1", OK, ["came through"] * 4 + ["switched off"]),
                                     ("2 3 0 NOLISTEN 0 UNKNOWN 1", REFUSED,
                                      ["came through", "refused", "no program on this box", "nobody outside", "switched off"]),
+                                    ("2 0 NOLISTEN 2 2 1", REFUSED, ["came", "no program on this box", "came", "came", "off"]),
                                     ("2 0 UNKNOWN 2 2 1", FAILED, ["came", "nobody outside", "came", "came", "off"])):
             environment = {"LD_PRELOAD": STAND_IN, "TAVO_REACH": answer}
             got, told = self.json("test", **environment)
@@ -691,7 +703,7 @@ class Tool(unittest.TestCase):
         # The library itself, with no checker named anywhere.
         self.expect("test 2 3", FAILED, r"2 dns +53/udp +not tested(?s:.)*tavoportcheckd(?s:.)*\[portcheck\]")
         put("/etc/tavo/platform.conf", '[portcheck]\nurl="http://127.0.0.1:1"\ntoken="0123456789abcdef"\n')
-        self.expect("test 2", FAILED, r"53/udp +not tested +53/udp: .*checker cannot be reached")
+        self.expect("test 2", REFUSED, r"nobody listens on port 53 of this box\n(?s:.)*53/udp +not tested +the port checker cannot be reached")
         os.unlink("/etc/tavo/platform.conf")
         self.expect("test 7", USAGE, "there is no rule 7; the rules are 1, 2, 3")
 
@@ -790,7 +802,7 @@ class Tool(unittest.TestCase):
                      outside="100.64.3.4")
         self.assertEqual(self.standing(), (REFUSED, "partly", ["refused", "waiting", "off"]))
         self.expect("status", REFUSED,
-                    r"the provider's own(?s:.)*7 web +443/tcp to 8443 +refused +another device .*: 192.168.77.7 \(console\\x1b\[2J\), since \d"
+                    r"the provider's own(?s:.)*7 web +443/tcp to 8443 +refused +another device .* \(192.168.77.7, console\\x1b\[2J\), since \d"
                     r"(?s:.)*\n8 +53,5000-5001/tcp, 53,5000/udp +open +since .*\n8 +5001/udp +waiting +taken, .*until 1970-01-01"
                     r"(?s:.)*\n9 x +9/tcp +off\n(?s:.)*8080/tcp +192.168.77.9 +its former address\n(?s:.)*2 of 2 rules are not in force")
         told = self.json("status")[1]
@@ -871,7 +883,7 @@ class Tool(unittest.TestCase):
         rest = " TCP:53@192.168.77.2:53 UDP:53@192.168.77.2:53 TCP:5000@192.168.77.2:5000 TCP:5001@192.168.77.2:5001 " \
                "UDP:5000@192.168.77.2:5000 UDP:5001@192.168.77.2:5001 TCP:7@192.168.77.2:70"
         for table, code, pattern in ((mine + rest, OK, "7/tcp +70 +console(?s:.)*all 2 rules are in force"),
-                                     (other + rest, REFUSED, r"web +443/tcp to 8443 +refused +another device .*192.168.77.99 \(console\\x1b"),
+                                     (other + rest, REFUSED, r"web +443/tcp to 8443 +refused +another device .* \(192.168.77.99, console\\x1b"),
                                      ("TCP:443@192.168.77.2:1" + rest, REFUSED, "the router leads it to port 1 of this box"),
                                      (rest, REFUSED, "web .* waiting +it is not in the router's table now")):
             self.expect("status --live", code, pattern, LD_PRELOAD=STAND_IN, TAVO_USED=table)
@@ -992,8 +1004,8 @@ class Tool(unittest.TestCase):
         put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="9"\n')
         self.expect("service list", OK, "no rule belongs to a service")
         self.store((1, "tcp", "443", "8443", "web"))
-        self.expect("service set hoplink 80/tcp 81/udp --test", FAILED,
-                    "80/tcp +ok(?s:.)*81/udp +not tested +no program(?s:.)*could not be judged", **world)
+        self.expect("service set hoplink 80/tcp 81/udp --test", REFUSED,
+                    "80/tcp +ok(?s:.)*81/udp +not tested +no program(?s:.)*do not answer to the outside", **world)
         self.expect("service set hoplink 80/tcp 9/tcp", REFUSED, "9/tcp +stays out: another host(?s:.)*stay out", **world)
         self.expect("service list", OK, "hoplink +2 +enabled +tcp +80\n(?s:.)*web +1 ")
         self.assertEqual(self.json("service", "list")[1]["rules"][0]["service_id"], "HopLink")
