@@ -12,21 +12,22 @@ import unittest
 from urllib.parse import quote
 
 import homelab
-from homelab import BOX, GATEWAY, HERE, LAN2, PUBLIC, sh, wait_for
+from homelab import BOX, BUILD, GATEWAY, HERE, LAN2, PUBLIC, sh, wait_for
 
 LAB = None
 JOURNAL = []  # (priority, program, text)
 HOOKS, RAN = "/etc/tavo/hooks.d", "/tmp/hooks"
 EVENT_LOG = "/var/log/tavo/event.log"
 WARNING, NOTICE = 28, 29  # of a daemon
-EVENTS = {"port-lost": (WARNING, "0x13100030", "Lost on the router"),
-          "port-refused": (WARNING, "0x13100031", "Refused by the router"),
-          "port-back": (NOTICE, "0x13100032", "Open on the router now"),
-          "router-gone": (WARNING, "0x13100033", "The router is gone"),
-          "router-back": (NOTICE, "0x13100034", "The router is back"),
-          "router-replaced": (NOTICE, "0x13100035", "The router is another one"),
-          "address-changed": (NOTICE, "0x13100036", "The outside address has changed"),
-          "renewed": (NOTICE, "0x13100037", "The router had lost these ports, and has them again")}
+OK, REFUSED, AWAY = 0, 4, 6  # exit codes of the status
+EVENTS = {"port-lost": (WARNING, "0x13100030", "Lost on the router", REFUSED),
+          "port-refused": (WARNING, "0x13100031", "Refused by the router", REFUSED),
+          "port-back": (NOTICE, "0x13100032", "Open on the router now", OK),
+          "router-gone": (WARNING, "0x13100033", "The router is gone", AWAY),
+          "router-back": (NOTICE, "0x13100034", "The router is back", OK),
+          "router-replaced": (NOTICE, "0x13100035", "The router is another one", OK),
+          "address-changed": (NOTICE, "0x13100036", "The outside address has changed", OK),
+          "renewed": (NOTICE, "0x13100037", "The router had lost these ports, and has them again", OK)}
 HOSTILE = "con'sole\";$(touch /tmp/harm)`touch /tmp/harm`"
 PORT = "5001/tcp (service 1)"
 GATEWAY_URL = f"http://{GATEWAY}:5000"
@@ -97,7 +98,7 @@ class Story(unittest.TestCase):
     def kernel_told(self):
         """The news in the system log, as (event, text)."""
         return [(event, text.split(": ", 1)[1]) for priority, program, text in JOURNAL if program == self.daemon
-                for event, (wanted, _, head) in EVENTS.items() if text.startswith(head) and priority == wanted]
+                for event, (wanted, _, head, _) in EVENTS.items() if text.startswith(head) and priority == wanted]
 
     def told(self, *news, seconds=60):
         """Exactly this has been told so far, as (event, pattern of the text), and the same everywhere."""
@@ -112,9 +113,23 @@ class Story(unittest.TestCase):
         lines = [line for line in lines if " 0x1310003" in line]
         self.assertEqual(len(lines), len(there), lines)
         for line, (event, text) in zip(lines, there):
-            priority, number, head = EVENTS[event]
+            priority, number, head, _ = EVENTS[event]
             self.assertIn(f"{'warning' if priority == WARNING else 'info'} {number} {head}: {text}", line)
-        return hooked()[-1] if there else {}
+        facts = hooked()[-1] if there else {}
+        self.status(EVENTS[there[-1][0]][3] if there else OK, facts.get("TAVO_WHY", ""))
+        return facts
+
+    def status(self, code, why=""):
+        """What the tool's user is told at this moment, and with which exit code."""
+        def asked():
+            done = LAB.run("box", f"{BUILD}/cli/tavoportmap status", check=False)
+            said.append(f"{done.returncode}: {done.stdout}{done.stderr}")
+            return done.returncode == code and why in " ".join(said[-1].split())
+        said = []
+        try:
+            wait_for(asked, 10, f"status answers {code} and says {why!r}")
+        except AssertionError as error:
+            raise AssertionError(f"{error}, not {said[-1]}") from None
 
 
 class ScriptedRouter(Story):
@@ -224,7 +239,7 @@ class RealRouter(Story):
 
     def test_no_gateway_any_more(self):
         LAB.run("box", "ip route del default")
-        gone = ("router-gone", "this box has no gateway")
+        gone = ("router-gone", "this box has no default gateway")
         self.told(gone)
         self.assertEqual((router_word(), row()["word"], published()["gateway"]), ("no_gateway", "nogateway", None))
 
@@ -248,7 +263,7 @@ class RealRouter(Story):
         self.told()
         LAB.stop_daemon(signal.SIGKILL)
         self.assertEqual((row()["state"], LAB.daemon_pid()), ("open", 0))  # as it was when it last looked
-        self.told()
+        self.status(AWAY)
 
 
 class Natpmp(Story):

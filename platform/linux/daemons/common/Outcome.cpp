@@ -83,7 +83,7 @@ std::string WhyOf(RouterState enRouter, const std::string& szProtocol) {
         case RouterState::kSilent:
             return "the router does not answer by " + szProtocol;
         case RouterState::kNoGateway:
-            return "this box has no gateway";
+            return "this box has no default gateway";
         case RouterState::kBusy:
             return "the other daemon has not taken its mappings away yet";
         default:
