@@ -7,6 +7,9 @@
 #include <fstream>
 #include <iostream>
 
+#include "Answer.h"
+#include "OnSignal.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -19,14 +22,15 @@ public:
         quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
         mBlChanged = mBlChanged && tcsetattr(STDIN_FILENO, TCSAFLUSH, &quiet) == 0;
     }
-    ~NoEcho() {
+    ~NoEcho() { Restore(); }
+    NoEcho(const NoEcho&) = delete;
+    NoEcho& operator=(const NoEcho&) = delete;
+    bool IsOff() const { return mBlChanged; }
+    void Restore() const {
         if (mBlChanged) {
             tcsetattr(STDIN_FILENO, TCSAFLUSH, &mOld);
         }
     }
-    NoEcho(const NoEcho&) = delete;
-    NoEcho& operator=(const NoEcho&) = delete;
-    bool IsOff() const { return mBlChanged; }
 
 private:
     termios mOld = {};
@@ -59,6 +63,11 @@ std::optional<std::string> AskSecret(const std::string& szQuestion) {
     if (!noEcho.IsOff()) {
         return std::nullopt;
     }
+    const OnSignal signals([&noEcho] {
+        noEcho.Restore();
+        Tell("\n");
+        return static_cast<int>(kFailed);
+    });
     std::cerr << szQuestion << std::flush;
     const auto szSecret = FirstLine(std::cin);
     std::cerr << std::endl;

@@ -14,6 +14,7 @@ import shutil
 import signal
 import socket
 import subprocess
+import termios
 import time
 import unittest
 
@@ -613,6 +614,23 @@ class Tool(unittest.TestCase):
         self.expect("router set --upnp no", OK, "stored as the settings")
         self.expect("router show --show-password", OK, "user +admin\npassword +n3w\nconnection +http, port 80")
         self.assertFalse(os.path.exists(f"{CONF}/router_account.conf"))
+
+    def test_a_password_that_is_not_given_after_all_leaves_the_terminal_as_it_was(self):
+        put(ROUTER, KNOWN % ("yes", "no"))
+        before = get(ROUTER)
+        pid, fd = pty.fork()
+        if pid == 0:
+            os.execv(TOOL, [TOOL, "router", "set", "--ask-password"])
+        text = b""
+        while b"account: " not in text:
+            text += os.read(fd, 4096)
+        echo = lambda: bool(termios.tcgetattr(fd)[3] & termios.ECHO)
+        self.assertFalse(echo())
+        os.kill(pid, signal.SIGINT)
+        self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), FAILED)
+        self.assertTrue(echo())
+        self.assertEqual(get(ROUTER), before)
+        os.close(fd)
 
     # ---- router tests ---------------------------------------------------------------------------
 
