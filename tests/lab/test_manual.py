@@ -84,6 +84,9 @@ class Manual(unittest.TestCase):
         self.assertEqual(self.rows()[0], {"9999/tcp": ("refused", "the router already forwards this port for something else"),
                                           "5001/tcp": ("open", "")})
         self.assertIn({"address": LAN2, "description": "tavo:another box"}, [row["holder"] for row in self.rows()[1]["rules"]])
+        LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5001,5002")
+        self.assertEqual([(row["box_port"], row["state"]) for row in self.rows()[1]["rules"]],
+                         [(5001, "open"), (5002, "refused")], "of two rules for one port each has its own row")
         LAB.stop_router()
         LAB.start_web("blind")
         LAB.save("1,1,tcp,5001,5002", "2,1,tcp,9999,9999")

@@ -1,4 +1,5 @@
 // The platform: files that survive any value and any failure, processes, port lists, the database.
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -6,10 +7,29 @@
 #include <thread>
 
 #include "core/TextFile.h"
+#include "daemons/common/Wanted.h"
+#include "daemons/tavohook/Hooks.h"
 #include "portforward/PortText.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 #include "world.h"
+
+namespace {
+
+std::string gSzForeign;  // the file that another user owns; it takes no such user
+
+}  // namespace
+
+extern "C" int fstat(int fd, struct stat* pStatus) noexcept {
+    static const auto fnReal = reinterpret_cast<int (*)(int, struct stat*)>(dlsym(RTLD_NEXT, "fstat"));
+    const int nResult = fnReal(fd, pStatus);
+    std::error_code error;
+    if (!gSzForeign.empty() &&
+        std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), error) == gSzForeign) {
+        pStatus->st_uid = 1000;
+    }
+    return nResult;
+}
 
 namespace {
 
@@ -174,6 +194,45 @@ TEST(Process, StartsAreReportedTrulyInOddCallers) {
     EXPECT_EQ(TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr), -1);
     EXPECT_EQ(TLIBCSystem("true"), 255);
     signal(SIGCHLD, SIG_DFL);
+}
+
+TEST(Hooks, AreRunOnlyWhereNobodyButRootOwnsThem) {
+    const std::string szDirectory = "/tmp/t/hooks";
+    std::filesystem::create_directories(szDirectory);
+    Write(szDirectory + "/10-a", "");
+    chmod((szDirectory + "/10-a").c_str(), 0755);
+    for (const auto& [szForeign, szRefused] : {std::pair(std::string("/none"), std::string()),
+                                               {szDirectory + "/10-a", szDirectory + "/10-a: "},
+                                               {szDirectory, szDirectory + ": "}}) {
+        gSzForeign = szForeign;
+        std::vector<std::string> rgszRefused;
+        const auto rgszHooks = tavo::FindHooks(szDirectory, rgszRefused);
+        gSzForeign.clear();
+        EXPECT_EQ(rgszHooks, szRefused.empty() ? std::vector<std::string>{"10-a"} : std::vector<std::string>());
+        EXPECT_EQ(rgszRefused, szRefused.empty() ? std::vector<std::string>()
+                                                 : std::vector{szRefused + "others than root may change it"});
+    }
+}
+
+TEST(Rules, EachOutcomeHasANameOfItsOwn) {
+    std::string szRules;
+    for (const char* szPorts : {"\"9\"\ns_port=\"1-2\"", "\"9\"\ns_port=\"9\"", "\"9\"\ns_port=\"8\"",
+                                "\"9\"\ns_port=\"7\"", "\"9\"\ns_port=\"1-3\""}) {
+        szRules += "[" + std::to_string(szRules.size()) +
+                   "]\nenabled=\"1\"\nservice=\"web\"\nprotocol name=\"tcp\"\nr_port=" + szPorts + "\n";
+    }
+    Write("/etc/portforward/rule.conf", szRules);
+    Write("/etc/tavoinfo.conf", "runupnpportmapping=\"yes\"\n");
+    const tavo::WantedSet wanted = tavo::ReadWanted("runupnpportmapping");
+    ASSERT_EQ(wanted.rgMappings.size(), 1U);
+    std::vector<std::string> rgszNames = {MappingName(wanted.rgMappings.front())};
+    for (const tavo::Outcome& outcome : wanted.rgRefused) {
+        rgszNames.push_back(outcome.szName + " " + outcome.verdict.szWord);
+    }
+    EXPECT_EQ(rgszNames, (std::vector<std::string>{"9/tcp", "9/tcp (web) invalid", "9/tcp (web, 2) duplicate",
+                                                   "9/tcp (web, 3) duplicate", "9/tcp (web, 4) invalid"}));
+    std::filesystem::remove("/etc/portforward/rule.conf");
+    std::filesystem::remove("/etc/tavoinfo.conf");
 }
 
 TEST(Rules, AreTakenApartPairByPair) {

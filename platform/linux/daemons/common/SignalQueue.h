@@ -1,6 +1,6 @@
 // The signals of a daemon, taken in when it asks for them. Relies on signalfd.
 // Promises: SIGHUP is a request, SIGTERM and SIGINT are a stop, SIGUSR1 is a stop that leaves what was made to
-// whoever comes next; none is lost; SIGPIPE never comes.
+// whoever comes next; none is lost; SIGPIPE never comes; a child's end only wakes who waits.
 #pragma once
 
 #include <signal.h>
@@ -17,11 +17,12 @@ class SignalQueue {
 public:
     SignalQueue() {
         sigemptyset(&mSignals);
-        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT, SIGUSR1}) {
+        for (const int nSignal : {SIGHUP, SIGTERM, SIGINT, SIGUSR1, SIGCHLD}) {
             sigaddset(&mSignals, nSignal);
         }
         sigprocmask(SIG_BLOCK, &mSignals, nullptr);
         signal(SIGPIPE, SIG_IGN);
+        signal(SIGCHLD, SIG_DFL);  // an ignored end is kept for nobody
         mFd.Reset(signalfd(-1, &mSignals, SFD_CLOEXEC | SFD_NONBLOCK));
     }
     int Fd() const { return mFd.Get(); }
@@ -32,7 +33,7 @@ public:
         while (read(mFd.Get(), &info, sizeof(info)) == sizeof(info)) {
             if (info.ssi_signo == SIGHUP) {
                 mBlRequested = true;
-            } else {
+            } else if (info.ssi_signo != SIGCHLD) {
                 mBlStop = true;
                 mBlHandOver = mBlHandOver || info.ssi_signo == SIGUSR1;
             }

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <map>
 #include <memory>
+#include <set>
 #include <utility>
 
 #include "core/TextFile.h"
@@ -41,13 +42,28 @@ Outcome RefusedRule(const std::string& szName, const char* szWord, const TAVO_PF
     return outcome;
 }
 
-// "5000/tcp (web)": the port as the one rule asks for it, beside "5000/tcp", which another rule has.
+// The port as the one rule asks for it, beside the same port, which another rule has.
 Outcome Duplicate(const RouterMapping& mapping, const TAVO_PF_CONF* pRule) {
-    Outcome outcome = RefusedRule(MappingName(mapping) + " (" + ServiceOf(pRule) + ")", "duplicate", pRule);
+    Outcome outcome = RefusedRule(MappingName(mapping), "duplicate", pRule);
     outcome.szProtocol = mapping.szProtocol;
     outcome.nRouterPort = mapping.nRouterPort;
     outcome.nBoxPort = mapping.nBoxPort;
     return outcome;
+}
+
+// Two outcomes of one name would be one to the status file and to the notices, and a change at every pass. So what
+// is not asked for stands beside "5000/tcp" as "5000/tcp (web)", and next to that as "5000/tcp (web, 2)".
+void NameApart(WantedSet& wanted) {
+    std::set<std::string> setNames;
+    for (const auto& [szName, szRule] : wanted.mapRules) {
+        setNames.insert(szName);
+    }
+    for (Outcome& outcome : wanted.rgRefused) {
+        const std::string szPlain = outcome.szName;
+        for (int i = 1; !setNames.insert(outcome.szName).second; ++i) {
+            outcome.szName = szPlain + " (" + KeyText(outcome.szRule) + (i == 1 ? "" : ", " + std::to_string(i)) + ")";
+        }
+    }
 }
 
 // Takes a rule's single mappings in; the first rule that asks for a port has it.
@@ -111,6 +127,7 @@ WantedSet ReadWanted(const char* szRunKey) {
             wanted.rgRefused.push_back(RefusedRule(RuleName(pRule), "invalid", pRule));
         }
     }
+    NameApart(wanted);
     return wanted;
 }
 

@@ -15,7 +15,7 @@ namespace tavo {
 
 struct WantedSet {
     std::vector<RouterMapping> rgMappings;  // client and lease still to be filled
-    // What no router is asked for, as text for a user: rules whose ports cannot be paired ("invalid"), and
+    // What no router is asked for, each under a name of its own: rules whose ports cannot be paired ("invalid"), and
     // ports that an earlier rule sends to another port of the box ("duplicate").
     OutcomeList rgRefused;
     std::map<std::string, std::string> mapRules;  // which rule asked for a mapping, by the mapping's name

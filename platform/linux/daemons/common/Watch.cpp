@@ -1,4 +1,4 @@
-// See Watch.h. Relies on Linux's pidfd. Promises: see Watch.h.
+// See Watch.h. Relies on fork and the signal queue. Promises: see Watch.h.
 #include "daemons/common/Watch.h"
 
 #include <poll.h>
@@ -10,11 +10,6 @@
 #include <chrono>
 #include <cstring>
 #include <deque>
-#include <iterator>
-
-extern "C" {  // this header leaves it out
-#include <sys/pidfd.h>
-}
 
 namespace tavo {
 
@@ -31,16 +26,16 @@ constexpr char kTitle[] = "tavowatch";
 }  // namespace
 
 int WaitForChild(pid_t pid, SignalQueue& signals, const std::function<void()>& fnPassOn) {
-    const Descriptor fdEnd(pidfd_open(pid, 0));
-    pollfd rgWaiting[] = {{signals.Fd(), POLLIN, 0}, {fdEnd.Get(), POLLIN, 0}};
-    while (fdEnd.Get() >= 0 && rgWaiting[1].revents == 0) {
-        poll(rgWaiting, std::size(rgWaiting), -1);
-        if (rgWaiting[0].revents != 0 && rgWaiting[1].revents == 0) {
-            fnPassOn();
+    for (;;) {
+        fnPassOn();
+        signals.Drain();  // before the look at the child, whose end may come at any moment and wakes from then on
+        int nStatus = -1;
+        if (const pid_t pidEnded = waitpid(pid, &nStatus, WNOHANG); pidEnded != 0) {
+            return pidEnded == pid ? nStatus : -1;
         }
+        pollfd waiting = {signals.Fd(), POLLIN, 0};
+        poll(&waiting, 1, -1);
     }
-    int nStatus = -1;
-    return waitpid(pid, &nStatus, 0) == pid ? nStatus : -1;
 }
 
 Watch::Watch(const char* szName, char* szTitle)
@@ -98,7 +93,7 @@ int Watch::Run(const std::function<int()>& fnWork) {
             return 1;
         }
         ShowAs(kTitle, kTitle);
-        PassOn(pid);  // a stop that came in the pause: what the crash left in the router is taken away
+        // Also a stop that came in the pause: what the crash left in the router is taken away.
         const int nStatus = WaitForChild(pid, mSignals, [this, pid] { PassOn(pid); });
         if (nStatus < 0 || WIFEXITED(nStatus)) {
             return nStatus < 0 ? 1 : WEXITSTATUS(nStatus);

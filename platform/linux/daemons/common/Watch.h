@@ -1,5 +1,5 @@
 // A parent that watches over the process that does the work, where no service manager does.
-// Relies on pidfd and the signals of a daemon. Promises: passes signals on; a crash is followed by a new start
+// Relies on the signals of a daemon. Promises: passes signals on; a crash is followed by a new start
 // after a pause, not without end; the parent never goes by the name of the work that it watches.
 #pragma once
 
@@ -13,7 +13,7 @@
 
 namespace tavo {
 
-// Waits until the child has ended; fnPassOn is called when a signal has come meanwhile. Its wait status.
+// Waits until the child has ended; fnPassOn is called at first, and when a signal has come. Its wait status.
 int WaitForChild(pid_t pid, SignalQueue& signals, const std::function<void()>& fnPassOn);
 
 class Watch {

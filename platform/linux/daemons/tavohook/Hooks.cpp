@@ -1,4 +1,4 @@
-// Finds and runs hooks. Relies on process descriptors, to wait for a child and its output at once.
+// Finds and runs hooks. Relies on looks at the child, many a second, while it waits for what the child says.
 // Promises: see Hooks.h.
 #include "daemons/tavohook/Hooks.h"
 
@@ -13,10 +13,6 @@
 #include <array>
 #include <cerrno>
 
-extern "C" {  // this header leaves it out
-#include <sys/pidfd.h>
-}
-
 #include "core/Descriptor.h"
 #include "core/Directory.h"
 #include "daemons/common/Outcome.h"
@@ -30,8 +26,9 @@ using Clock = std::chrono::steady_clock;
 constexpr char kPath[] = "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin";
 constexpr size_t kMostHooks = 64;
 constexpr size_t kMostOutput = 300;
-constexpr int kLastPieces = 16;                       // of what an ended hook has said
-constexpr auto kKillAfter = std::chrono::seconds(2);  // between the polite signal and the other one
+constexpr int kLastPieces = 16;                        // of what an ended hook has said
+constexpr auto kKillAfter = std::chrono::seconds(2);   // between the polite signal and the other one
+constexpr auto kTick = std::chrono::milliseconds(50);  // how late an end may be seen
 constexpr int kNotRun = 127;
 constexpr int kSignalled = 128;
 
@@ -90,18 +87,22 @@ bool TakeOutput(int fd, std::string& szOutput) {
     return nRead > 0;
 }
 
+// The child keeps its pid all the same until it is waited for.
+bool HasEnded(pid_t pid) {
+    siginfo_t info = {};
+    return waitid(P_PID, static_cast<id_t>(pid), &info, WEXITED | WNOHANG | WNOWAIT) != 0 || info.si_pid == pid;
+}
+
 // Whether the child has ended by then. What it says is taken in the meantime.
-bool WaitUntil(int fdProcess, int fdOutput, Clock::time_point end, std::string& szOutput) {
-    bool blEnded = false;
+bool WaitUntil(pid_t pid, int fdOutput, Clock::time_point end, std::string& szOutput) {
+    bool blEnded = HasEnded(pid);
     while (!blEnded && Clock::now() < end) {
-        const auto nLeft = std::chrono::ceil<std::chrono::milliseconds>(end - Clock::now()).count();
-        pollfd rgWaiting[] = {{fdProcess, POLLIN, 0}, {fdOutput, POLLIN, 0}};
-        poll(rgWaiting, std::size(rgWaiting), static_cast<int>(nLeft));
-        blEnded = rgWaiting[0].revents != 0;
-        if (rgWaiting[1].revents != 0 && !TakeOutput(fdOutput, szOutput) &&
-            (rgWaiting[1].revents & (POLLHUP | POLLERR)) != 0) {
+        pollfd output = {fdOutput, POLLIN, 0};
+        poll(&output, 1, static_cast<int>(kTick.count()));
+        if (output.revents != 0 && !TakeOutput(fdOutput, szOutput) && (output.revents & (POLLHUP | POLLERR)) != 0) {
             fdOutput = -1;  // nobody is there to say anything; poll passes over it
         }
+        blEnded = HasEnded(pid);
     }
     for (int i = 0; blEnded && i < kLastPieces && TakeOutput(fdOutput, szOutput); ++i) {
     }
@@ -160,20 +161,15 @@ HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFac
         BecomeHook(szPath, rgszEnvironment.data(), fdWrite.Get());
     }
     fdWrite.Reset();
-    const Descriptor fdProcess(pid < 0 ? -1 : pidfd_open(pid, 0));
-    if (fdProcess.Get() < 0) {
-        if (pid > 0) {
-            kill(pid, SIGKILL);
-            waitpid(pid, nullptr, 0);
-        }
+    if (pid < 0) {
         return end;
     }
     end.blStarted = true;
     std::string szOutput;
-    end.blInTime = WaitUntil(fdProcess.Get(), fdRead.Get(), Clock::now() + limit, szOutput);
+    end.blInTime = WaitUntil(pid, fdRead.Get(), Clock::now() + limit, szOutput);
     if (!end.blInTime) {
         kill(-pid, SIGTERM);
-        WaitUntil(fdProcess.Get(), fdRead.Get(), Clock::now() + kKillAfter, szOutput);
+        WaitUntil(pid, fdRead.Get(), Clock::now() + kKillAfter, szOutput);
         kill(-pid, SIGKILL);  // also who of its group is left
     }
     int nStatus = 0;

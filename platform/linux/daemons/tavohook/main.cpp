@@ -2,6 +2,7 @@
 // Relies on Hooks, and on a socket as standard input on which each message is one notice. Promises: see --help;
 // ends soon after the daemon that started it.
 #include <poll.h>
+#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <syslog.h>
@@ -118,6 +119,7 @@ std::vector<std::string> TryFacts(std::vector<std::string> rgFacts) {
 int main(int argc, char** argv) {
     const std::string_view szVerb = argc > 1 ? argv[1] : "";
     umask(022);
+    signal(SIGCHLD, SIG_DFL);  // the ends of hooks are told to nobody else
     if (szVerb == "--follow" && argc == 2) {
         openlog("tavohook", LOG_PID, LOG_DAEMON);
         return Runner().Follow();

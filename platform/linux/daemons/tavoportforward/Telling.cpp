@@ -79,10 +79,9 @@ Verdict NotInPlace(const Refusal& refusal) {
 OutcomeList Outcomes(const RunResult& result) {
     OutcomeList rgOutcomes;
     for (const Job& job : result.rgWanted) {
-        const bool blInPlace =
-            std::none_of(result.rgRefusals.begin(), result.rgRefusals.end(), [&](const Refusal& refusal) {
-                return refusal.enKind == RefusalKind::kForward && refusal.szWhat == job.Text();
-            });
+        const bool blInPlace = std::none_of(
+            result.rgRefusals.begin(), result.rgRefusals.end(),
+            [&](const Refusal& refusal) { return refusal.enKind == RefusalKind::kForward && refusal.job.IsSame(job); });
         if (blInPlace) {
             AddRows(job, "", {PortState::kOpen, "1"}, rgOutcomes);
         }
