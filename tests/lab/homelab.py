@@ -428,3 +428,7 @@ def run_tests(tests):
         return 1 if failed or not result.testsRun else 0
 
     sys.exit(in_lab(main))
+
+
+if __name__ == "__main__":  # says what this machine lacks, before anything is built
+    Lab()
