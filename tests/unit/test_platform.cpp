@@ -2,8 +2,12 @@
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 
+#include <cerrno>
+#include <cstdio>
 #include <thread>
 
 #include "core/TextFile.h"
@@ -16,9 +20,24 @@
 
 namespace {
 
-std::string gSzForeign;  // the file that another user owns; it takes no such user
+std::string gSzForeign;    // the file that another user owns; it takes no such user
+int gNRenamesLeft = -1;    // before the process is killed; below 0: it is not
+bool gBlExchanges = true;  // the file system can exchange two names
 
 }  // namespace
+
+extern "C" int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsigned nFlags) noexcept {
+    static const auto fnReal =
+        reinterpret_cast<int (*)(int, const char*, int, const char*, unsigned)>(dlsym(RTLD_NEXT, "renameat2"));
+    if (gNRenamesLeft >= 0 && gNRenamesLeft-- == 0) {
+        raise(SIGKILL);
+    }
+    if (nFlags == RENAME_EXCHANGE && !gBlExchanges) {
+        errno = EINVAL;
+        return -1;
+    }
+    return fnReal(fdFrom, szFrom, fdTo, szTo, nFlags);
+}
 
 extern "C" int fstat(int fd, struct stat* pStatus) noexcept {
     static const auto fnReal = reinterpret_cast<int (*)(int, struct stat*)>(dlsym(RTLD_NEXT, "fstat"));
@@ -211,6 +230,42 @@ TEST(Hooks, AreRunOnlyWhereNobodyButRootOwnsThem) {
         EXPECT_EQ(rgszHooks, szRefused.empty() ? std::vector<std::string>{"10-a"} : std::vector<std::string>());
         EXPECT_EQ(rgszRefused, szRefused.empty() ? std::vector<std::string>()
                                                  : std::vector{szRefused + "others than root may change it"});
+    }
+}
+
+TEST(RouterDatabase, ARefreshThatIsKilledLosesNothing) {
+    const std::string szDatabase = "/etc.defaults/portforward/routerdb";
+    Write("/usr/tavo/bin/wget", "#!/bin/sh\ncp /tmp/t/new.tgz \"$3\"\n");
+    chmod("/usr/tavo/bin/wget", 0755);
+    Write("/etc/tavo/platform.conf", "[download]\ndatabase_url=\"http://192.0.2.1\"\n");
+    const auto fnMake = [](const std::string& szPlace, int nEdition) {
+        Write(szPlace + "/version", "version=\"" + std::to_string(nEdition) + "\"\n");
+        Write(szPlace + "/A/B/1/router.des", "[global]\nsyntax version=\"1\"\n");
+    };
+    fnMake("/tmp/t/new", 8);
+    ASSERT_EQ(TLIBCSystem("tar -C /tmp/t/new -czf /tmp/t/new.tgz ."), 0);
+    for (const bool blExchanges : {true, false}) {
+        int nStatus = SIGKILL;
+        for (int nRenames = 0; !WIFEXITED(nStatus); ++nRenames) {
+            std::filesystem::remove_all(szDatabase);
+            fnMake(szDatabase, 7);
+            const pid_t pid = fork();
+            if (pid == 0) {
+                gBlExchanges = blExchanges;
+                gNRenamesLeft = nRenames;
+                _exit(TAVOPFRouterDBUpdate() == 8 ? 0 : 1);
+            }
+            waitpid(pid, &nStatus, 0);
+            TLIBCSzList* pList = nullptr;
+            EXPECT_EQ(RouterDBList(&pList), 1) << blExchanges << nRenames;
+            TLIBCSzListFree(pList);
+            EXPECT_EQ(TAVOPFRouterDBUpdate(), 8) << "and the next refresh does what this one was to do";
+            ASSERT_LT(nRenames, 9);
+        }
+        EXPECT_EQ(WEXITSTATUS(nStatus), 0);
+    }
+    for (const char* szPlace : {"/etc.defaults/portforward", "/etc/tavo/platform.conf", "/usr/tavo/bin/wget"}) {
+        std::filesystem::remove_all(szPlace);
     }
 }
 

@@ -2,9 +2,12 @@
 // in two directories. Promises: no name leads outside them; see RouterDatabase.h.
 #include "portforward/RouterDatabase.h"
 
+#include <fcntl.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <memory>
 #include <new>
 
@@ -137,6 +140,12 @@ std::vector<std::string> Directories(const fs::path& dir) {
     return rgszNames;
 }
 
+void BringBackDatabase() {
+    if (renameat2(AT_FDCWD, kDatabaseAside, AT_FDCWD, kDatabase, RENAME_NOREPLACE) == 0) {
+        syslog(LOG_WARNING, "%s was missing; the one before is back in its place", kDatabase);
+    }
+}
+
 void LinkOwnDescriptions(const fs::path& database) {
     if (IsDirectory(database)) {
         UnlinkGone(database);
@@ -164,6 +173,7 @@ int RouterDBList(TLIBCSzList** ppList) {
         if (ppList == nullptr) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
+        tavo::BringBackDatabase();
         tavo::LinkOwnDescriptions(kDatabase);
         if (!IsDirectory(kDatabase) && !IsDirectory(kOwnDatabase)) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
@@ -195,6 +205,7 @@ int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF*
         if (pSection == nullptr || pSection->pHash == nullptr || ppDesc == nullptr || ppOps == nullptr) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
+        tavo::BringBackDatabase();
         const fs::path dir = DescriptionDir(pSection);
         if (dir.empty()) {
             return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);

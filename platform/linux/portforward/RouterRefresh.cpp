@@ -1,16 +1,20 @@
 // The refresh of the downloaded router descriptions, and the place that they come from. Relies on wget, gzip and
 // tar. Promises: a refresh that fails, or whose descriptions this box could not use, leaves the old database and
 // says why; what the owner wrote stays.
+#include <fcntl.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <optional>
 
 #include "core/Border.h"
+#include "core/Descriptor.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterDatabase.h"
@@ -28,6 +32,7 @@ constexpr size_t kMaxReason = 400;
 
 using tavo::AtBorder;
 using tavo::kDatabase;
+using tavo::kDatabaseAside;
 
 int Fail(int nErr, int nLine) {
     TLIBCErrSet(nErr, kFile, nLine);
@@ -143,19 +148,32 @@ std::optional<std::string> Objection(const fs::path& database) {
     return std::nullopt;
 }
 
-// Puts the new database in the old one's place; the old one comes back when that fails.
-bool Swap(const fs::path& fresh, const fs::path& aside) {
-    const bool blOld = TLIBCFileExist(kDatabase) == 1;
-    if (blOld && rename(kDatabase, aside.c_str()) != 0) {
+bool Rename(const char* szFrom, const char* szTo, unsigned nFlags) {
+    return renameat2(AT_FDCWD, szFrom, AT_FDCWD, szTo, nFlags) == 0;
+}
+
+// Puts the new database in the old one's place; at every moment, a kill or a power cut leaves one of them whole.
+bool Swap(const fs::path& fresh) {
+    const tavo::Descriptor fdFresh(open(fresh.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (fdFresh.Get() < 0 || syncfs(fdFresh.Get()) != 0) {
         return false;
     }
-    if (rename(fresh.c_str(), kDatabase) == 0) {
-        return true;
+    if (Rename(fresh.c_str(), kDatabase, RENAME_EXCHANGE)) {
+        return true;  // the old one goes with the scratch
     }
-    if (blOld && rename(aside.c_str(), kDatabase) != 0) {
-        Fail(TLIBC_ERR_RENAME, __LINE__);
+    if (errno == ENOENT) {
+        return Rename(fresh.c_str(), kDatabase, 0);
     }
-    return false;
+    // A file system that exchanges nothing: between the two steps, whoever looks brings the old one back.
+    std::error_code error;
+    fs::remove_all(kDatabaseAside, error);
+    const bool blDone = Rename(kDatabase, kDatabaseAside, 0) && Rename(fresh.c_str(), kDatabase, 0);
+    if (blDone) {
+        fs::remove_all(kDatabaseAside, error);
+    } else {
+        tavo::BringBackDatabase();
+    }
+    return blDone;
 }
 
 }  // namespace
@@ -163,6 +181,7 @@ bool Swap(const fs::path& fresh, const fs::path& aside) {
 int TAVOPFRouterDBUpdate() {
     Reason()[0] = '\0';
     return AtBorder(-1, [&] {
+        tavo::BringBackDatabase();
         const std::string szLocation = GetRouterDBPath();
         if (szLocation.empty()) {
             tavo::LinkOwnDescriptions(kDatabase);
@@ -183,7 +202,7 @@ int TAVOPFRouterDBUpdate() {
         }
         const auto nEdition = static_cast<int>(Edition(fresh));
         tavo::LinkOwnDescriptions(fresh);
-        if (chmod(fresh.c_str(), 0755) != 0 || !Swap(fresh, scratch.Path() / "old")) {
+        if (chmod(fresh.c_str(), 0755) != 0 || !Swap(fresh)) {
             return Refuse(std::string("the new ones cannot be put in the place of ") + kDatabase);
         }
         return nEdition;
