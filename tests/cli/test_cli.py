@@ -918,7 +918,8 @@ class Tool(unittest.TestCase):
         self.publish(pid)
         for arguments, before, after in (((), "all 2 rules are in force", "443/tcp to 8443: refused, taken"),
                                          (("--json",), '"standing":"in_force"', '"standing":"partly"')):
-            with subprocess.Popen([TOOL, "status", "--watch", *arguments], text=True, stdout=subprocess.PIPE) as run:
+            with subprocess.Popen(["timeout", "60", TOOL, "status", "--watch", *arguments], text=True,
+                                  stdout=subprocess.PIPE) as run:
                 while before not in (line := run.stdout.readline()):
                     self.assertTrue(line)
                 self.publish(pid, (443, "tcp", {"state": "refused", "why": "taken"}))
