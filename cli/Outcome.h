@@ -15,7 +15,7 @@ namespace tavo::cli {
 // What the daemon that drives this router has published since then; nothing when it says nothing.
 std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSince);
 
-// "443/tcp refused: another device has this port on the router (192.168.1.7, console)", as a line; and as JSON.
+// A row for each port that is not open, with blAll for every one, and for what is left over; and as JSON.
 void AddPorts(const Published& published, bool blAll, Reply& reply);
 
 // What is so now that rules have been saved.

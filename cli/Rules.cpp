@@ -51,9 +51,7 @@ void WarnOfOverlaps(const Rules& rules, Reply& reply) {
 std::string FaultOfOverlap(const Rules& rules, const std::set<std::string>& setIds) {
     for (const Overlap& overlap : OverlapsOf(rules)) {
         if (setIds.count(overlap.szLater) + setIds.count(overlap.szEarlier) > 0) {
-            const std::string& szOther = setIds.count(overlap.szEarlier) == 0 || setIds.count(overlap.szLater) != 0
-                                             ? overlap.szEarlier
-                                             : overlap.szLater;
+            const std::string& szOther = setIds.count(overlap.szLater) != 0 ? overlap.szEarlier : overlap.szLater;
             return fmt::format(
                 "rule {} already forwards router port {}; choose another one, or 'rules remove {}', or add --force",
                 Clean(szOther), overlap.szPort, Clean(szOther));

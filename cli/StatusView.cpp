@@ -16,8 +16,9 @@ namespace {
 
 std::string OutsideWords(const Situation& situation) {
     const std::string szOutside = Clean(situation.Outside());
-    const std::string szCaveat = ReachCaveat(ReachOf(szOutside));
-    return ReachOf(szOutside) == Reach::kUnknown ? "not known" : szOutside + (szCaveat.empty() ? "" : ", ") + szCaveat;
+    const Reach enReach = ReachOf(szOutside);
+    const std::string szCaveat = ReachCaveat(enReach);
+    return enReach == Reach::kUnknown ? "not known" : szOutside + (szCaveat.empty() ? "" : ", ") + szCaveat;
 }
 
 // How many address translations a connection from outside would have to pass.

@@ -114,13 +114,11 @@ Reply Answer(int argc, char** argv, Request& request) {
 // Whoever starts the tool without standard input, output or error gets /dev/null there: the next file opened, a lock or
 // the rules, would stand in its place and get what is printed. And a reader that goes away ends no save in its midst.
 void PrepareStreams() {
-    while (true) {
-        const int fd = open("/dev/null", O_RDWR);
-        if (fd < 0 || fd > STDERR_FILENO) {
-            close(fd);
-            break;
-        }
-    }
+    int fd = -1;
+    do {
+        fd = open("/dev/null", O_RDWR);
+    } while (fd >= 0 && fd <= STDERR_FILENO);
+    close(fd);
     signal(SIGPIPE, SIG_IGN);
 }
 

@@ -23,9 +23,10 @@ extern "C" {
 int TAVORunKeysRemember(void);
 
 /* After an operation that came to nothing, with the router's lock held: puts the keys that this process
- * noted back where neither file has changed since, nor the keys by somebody else. Where the rules were written but no key was switched on
- * any more, the key of the router's settings is. A daemon whose key became "yes" is told (SIGHUP). 0: done
- * and forgotten, or there was no record of this process; -1: the keys cannot be written; the record stays. */
+ * noted back where neither file has changed since, nor the keys by somebody else. Where the rules were written
+ * but no key was switched on any more, the key of the router's settings is. A daemon whose key became "yes" is
+ * told (SIGHUP). 0: done and forgotten, or there was no record of this process; -1: the keys cannot be written;
+ * the record stays. */
 int TAVORunKeysRestore(void);
 
 /* After an operation that did what it should: forgets this process's record. 0: gone; -1: it is still there. */

@@ -26,6 +26,7 @@ namespace {
 
 using tavo::AtBorder;
 using tavo::Descriptor;
+using tavo::kRouterLock;
 using tavo::ReadFile;
 
 constexpr char kRecord[] = "/var/lib/tavo/run_keys.conf";
@@ -35,7 +36,6 @@ constexpr off_t kMaxRecord = 4096;
 constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
-constexpr char kRouterLock[] = "/tmp/routerconf.lock";
 constexpr size_t kStartField = 20;  // of /proc/PID/stat, counted from the one after the name
 
 struct Daemon {

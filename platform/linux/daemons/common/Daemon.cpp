@@ -20,6 +20,7 @@
 #include <string_view>
 
 #include "core/Descriptor.h"
+#include "core/RunKeys.h"
 #include "core/TextFile.h"
 #include "daemons/common/Instance.h"
 #include "daemons/common/SignalQueue.h"
@@ -51,7 +52,7 @@ constexpr char kMarkerDir[] = "/tmp";
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
 // As in tmpfiles.d, which makes them at the boot where systemd runs.
-constexpr const char* kLockFiles[] = {"/tmp/routerconf.lock", "/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock",
+constexpr const char* kLockFiles[] = {kRouterLock, "/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock",
                                       "/tmp/upnp_test.lock"};
 constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
