@@ -179,8 +179,8 @@ private:
 // Until the clock, a signal, a new file in the marker's directory or a word from the router.
 void Frame::Wait() {
     const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mNext - Clock::now()).count() + 1;
-    pollfd rgWaiting[] = {{mSignals.Fd(), POLLIN, 0}, {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}};
-    poll(rgWaiting, std::size(rgWaiting), static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
+    pollfd rgWaiting[] = {mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}};
+    mSignals.Wait(rgWaiting, static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
     alignas(inotify_event) char szEvents[4096];
     while (read(mFdEvents.Get(), szEvents, sizeof(szEvents)) > 0) {
     }
@@ -221,9 +221,7 @@ void Frame::Loop() {
         // here belongs to a request that has been served, though it may have come after the end of it.
         RemoveMarker();
         WritePidFile(mNames);  // whoever asks for a start deletes it, and makes the marker afterwards
-        if (!mSignals.HasRequest()) {
-            Wait();
-        }
+        Wait();
     }
     Stop();
 }

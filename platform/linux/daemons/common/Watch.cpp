@@ -1,7 +1,6 @@
 // See Watch.h. Relies on fork and the signal queue. Promises: see Watch.h.
 #include "daemons/common/Watch.h"
 
-#include <poll.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <syslog.h>
@@ -28,13 +27,11 @@ constexpr char kTitle[] = "tavowatch";
 int WaitForChild(pid_t pid, SignalQueue& signals, const std::function<void()>& fnPassOn) {
     for (;;) {
         fnPassOn();
-        signals.Drain();  // before the look at the child, whose end may come at any moment and wakes from then on
         int nStatus = -1;
         if (const pid_t pidEnded = waitpid(pid, &nStatus, WNOHANG); pidEnded != 0) {
             return pidEnded == pid ? nStatus : -1;
         }
-        pollfd waiting = {signals.Fd(), POLLIN, 0};
-        poll(&waiting, 1, -1);
+        signals.Wait(-1);
     }
 }
 
@@ -75,8 +72,7 @@ bool Watch::Pause() {
     const auto end = Clock::now() + kPause;
     while (!mSignals.IsStop() && !mSignals.TakeRequest() && Clock::now() < end) {
         const auto nLeft = std::chrono::ceil<std::chrono::milliseconds>(end - Clock::now()).count();
-        pollfd waiting = {mSignals.Fd(), POLLIN, 0};
-        poll(&waiting, 1, static_cast<int>(std::max<int64_t>(0, nLeft)));
+        mSignals.Wait(static_cast<int>(std::max<int64_t>(0, nLeft)));
     }
     return !mSignals.IsHandOver();
 }

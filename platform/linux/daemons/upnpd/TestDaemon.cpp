@@ -154,7 +154,7 @@ void TestDaemon::Answer() {
 // The next order; empty when the time is up or a signal came.
 std::string TestDaemon::NextOrder() {
     const auto end = Clock::now() + kIdleLimit;
-    std::vector<pollfd> rgWaiting = {{mSignals.Fd(), POLLIN, 0}, {mFdOrders.Get(), POLLIN, 0}};
+    std::vector<pollfd> rgWaiting = {mSignals.Waiting(), {mFdOrders.Get(), POLLIN, 0}};
     for (const Descriptor& fdPort : mRgFdPorts) {
         rgWaiting.push_back({fdPort.Get(), POLLIN, 0});
     }
@@ -168,7 +168,7 @@ std::string TestDaemon::NextOrder() {
             return szOrder;
         }
         const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(end - Clock::now()).count() + 1;
-        poll(rgWaiting.data(), rgWaiting.size(), static_cast<int>(std::max<int64_t>(0, nLeft)));
+        mSignals.Wait(rgWaiting, static_cast<int>(std::max<int64_t>(0, nLeft)));
         Answer();
     }
     return "";
