@@ -15,12 +15,7 @@
 #include "tavo/portforward.h"
 #include "world.h"
 
-namespace {
-
-// What the clock is ahead of the real one, in seconds.
 time_t gNClockAhead = 0;
-
-}  // namespace
 
 extern "C" {
 

@@ -264,6 +264,14 @@ TEST(RouterDatabase, ARefreshThatIsKilledLosesNothing) {
         }
         EXPECT_EQ(WEXITSTATUS(nStatus), 0);
     }
+    const auto fnEntries = [] {
+        return std::distance(std::filesystem::directory_iterator("/etc.defaults/portforward"), {});
+    };
+    EXPECT_GT(fnEntries(), 1) << "of a refresh that may still go on, nothing is touched";
+    gNClockAhead = 3600;
+    EXPECT_EQ(TAVOPFRouterDBUpdate(), 8);
+    gNClockAhead = 0;
+    EXPECT_EQ(fnEntries(), 1);
     for (const char* szPlace : {"/etc.defaults/portforward", "/etc/tavo/platform.conf", "/usr/tavo/bin/wget"}) {
         std::filesystem::remove_all(szPlace);
     }

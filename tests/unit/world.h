@@ -25,6 +25,8 @@ extern std::function<void()> gFnOnSleep;
 // Answers in place of the platform's write of router.conf, when set.
 extern std::function<int()> gFnOnConfSet;
 
+// What time() is ahead of the real clock, in seconds.
+extern time_t gNClockAhead;
 // Seconds that the clock jumps ahead each time somebody looks at it.
 extern int gNClockStep;
 

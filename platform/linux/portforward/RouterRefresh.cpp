@@ -11,10 +11,13 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <optional>
+#include <string_view>
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/Directory.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterDatabase.h"
@@ -29,6 +32,7 @@ constexpr char kArchive[] = "routerdb.tgz";
 constexpr int kLocationSize = 1024;
 constexpr int kVersionSize = 1024;
 constexpr size_t kMaxReason = 400;
+constexpr time_t kLongestRefreshSeconds = 600;  // the limits of the commands below, and some more
 
 using tavo::AtBorder;
 using tavo::kDatabase;
@@ -50,12 +54,19 @@ int Refuse(const std::string& szWhy) {
     return Fail(TLIBC_ERR_READ, __LINE__);
 }
 
-// A directory beside the database that goes away with the object.
+// A directory beside the database that goes away with the object; one of a refresh that was killed, with a later one.
 class Scratch {
 public:
-    Scratch() : mSzPath(std::string(kDatabase) + ".XXXXXX") {
+    Scratch() : mSzPath(kParent / (std::string(kPrefix) + "XXXXXX")) {
         std::error_code error;
-        fs::create_directories(fs::path(kDatabase).parent_path(), error);
+        fs::create_directories(kParent, error);
+        for (const std::string& szName : tavo::NamesIn(kParent).value_or(std::vector<std::string>())) {
+            struct stat status = {};
+            if (szName.starts_with(kPrefix) && lstat((kParent / szName).c_str(), &status) == 0 &&
+                std::time(nullptr) - status.st_ctime > kLongestRefreshSeconds) {
+                fs::remove_all(kParent / szName, error);
+            }
+        }
         mBlMade = mkdtemp(mSzPath.data()) != nullptr;
     }
     ~Scratch() {
@@ -71,6 +82,9 @@ public:
     fs::path Path() const { return mSzPath; }
 
 private:
+    static constexpr std::string_view kPrefix = ".routerdb.";
+    static inline const fs::path kParent = fs::path(kDatabase).parent_path();
+
     std::string mSzPath;
     bool mBlMade = false;
 };
