@@ -71,6 +71,18 @@ absent /run/upnpd.pid /usr/bin/tavoportmap
 [ -e /etc/portforward/rule.conf.draft ] || fail "removing took the rules away"
 install ./tavoportmap
 alive upnpd || fail "what was switched on does not run again"
+
+# A removal that is broken off: what it ended and took away comes back, also on a router's own pages (here is none).
+script() { "/var/lib/dpkg/info/tavoportmap.$1" "$2" 2>&1; }
+for szRules in there missing; do
+    echo 'tcp' >/var/lib/tavo/manual_router.made
+    [ $szRules = missing ] || echo '# mine' >/etc/portforward/rule.conf
+    script prerm remove | grep -q 'the router keeps forwards' && ! alive upnpd || fail "pages are not cleared, rules $szRules"
+    [ $szRules = missing ] || grep -q mine /etc/portforward/rule.conf || fail "the rules went with the forwards"
+    script postinst abort-remove | grep -q 'not all forwards are back' || fail "the pages are not filled again"
+    alive upnpd || fail "what a removal that was broken off had ended does not run again"
+    rm -f /etc/portforward/rule.conf
+done
 kill -9 "$(pid upnpd)" # its parent is about to start it again
 dpkg -P tavoportmap >/dev/null
 ! pgrep -x 'upnpd|tavowatch' >/dev/null || fail "a process was left running"

@@ -337,6 +337,16 @@ class Hooks(unittest.TestCase):
             LAB.write("/tmp/called", "")
         self.assertFalse(os.path.exists("/tmp/harm"))
 
+    def test_a_hook_ends_with_the_runner(self):
+        hook("10-hangs", "#!/bin/sh\necho $$ >/tmp/hanging\nexec sleep 1000\n")
+        with subprocess.Popen(["/usr/tavo/bin/tavohook", "--try"], stderr=subprocess.PIPE, text=True) as runner:
+            pid = int(wait_for(lambda: os.path.exists("/tmp/hanging") and LAB.read("/tmp/hanging"), 10, "the hook runs"))
+            runner.terminate()
+            self.assertIn("told to end", runner.communicate(timeout=10)[1])
+        self.assertFalse(os.path.exists(f"/proc/{pid}"))
+        os.unlink("/tmp/hanging")
+        os.unlink(f"{HOOKS}/10-hangs")
+
     def test_a_hook_that_hangs_holds_up_neither_passes_nor_a_stop_and_is_ended(self):
         hook("10-hangs", "#!/bin/sh\necho $$ >/tmp/hanging\ntrap '' TERM\nsleep 1000 & echo $! >>/tmp/hanging\nwait\n"
                          "while :; do sleep 1; done\n")

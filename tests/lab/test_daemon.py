@@ -1,5 +1,6 @@
 """A daemon outside any service manager: started again after a crash, handed over, stopped whatever state it is in."""
 import contextlib
+import fcntl
 import os
 import re
 import signal
@@ -74,17 +75,40 @@ class Daemon(unittest.TestCase):
         self.assertEqual(LAB.mappings(), MAPPED)
         self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
 
-    def test_a_start_makes_the_lock_files_and_follows_no_link(self):
+    def test_a_start_makes_the_lock_files_whatever_stands_in_their_places(self):
         LAB.stop_daemon(signal.SIGKILL)
         locks = re.findall(r"^f (\S+) 0600 root root", LAB.read(f"{HERE}/../../packaging/tmpfiles.conf"), re.M)
-        for path in locks:
+        def held(path):
+            LAB.write(path, "")
+            os.chmod(path, 0o666)
+            self.held = open(path, encoding="ascii")  # pylint: disable=consider-using-with
+            self.addCleanup(self.held.close)
+            fcntl.flock(self.held, fcntl.LOCK_EX)
+        for path, plant in zip(locks, (lambda path: os.symlink("/tmp/victim", path), os.mkfifo,
+                                       lambda path: os.makedirs(f"{path}/full"), held), strict=True):
             with contextlib.suppress(FileNotFoundError):
                 os.unlink(path)
-        os.symlink("/tmp/victim", locks[0])
-        self.addCleanup(os.unlink, locks[0])
+            plant(path)
         self.assertEqual(option(), 0)
         self.assertFalse(os.path.exists("/tmp/victim"))
-        self.assertEqual([os.lstat(path).st_mode for path in locks[1:]], [0o100600] * 3)
+        self.assertEqual([os.lstat(path).st_mode for path in locks], [0o100600] * 4)
+        self.assertEqual([name for name in os.listdir("/tmp") if ".lock." in name and
+                          not os.path.isdir(f"/tmp/{name}/full")], [])
+        with open(locks[3], encoding="ascii") as file:
+            fcntl.flock(file, fcntl.LOCK_EX | fcntl.LOCK_NB)
+        inodes = [os.stat(path).st_ino for path in locks]
+        LAB.stop_daemon(signal.SIGKILL)
+        self.assertEqual(option(), 0)
+        self.assertEqual([os.stat(path).st_ino for path in locks], inodes, "ours stay, as somebody may hold them")
+
+    def test_a_stop_says_when_the_router_could_not_be_asked(self):
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.stop_router()
+        run = LAB.run("box", f"{DAEMON} --stop", check=False)
+        LAB.start_router()
+        self.assertEqual(run.returncode, 1)
+        self.assertIn("it may keep them", run.stderr)
 
     def test_a_stop_takes_the_mappings_away_whatever_is_left_to_stop(self):
         for before in (lambda: None, self.crash, lambda: os.kill(LAB.watcher(), signal.SIGKILL),

@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
 #include <cstddef>
 #include <cstdio>
@@ -20,6 +21,7 @@
 #include <string_view>
 
 #include "core/Descriptor.h"
+#include "core/OwnFile.h"
 #include "core/RunKeys.h"
 #include "core/TextFile.h"
 #include "daemons/common/Instance.h"
@@ -34,7 +36,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 constexpr char kHelp[] =
-    "Usage: %s [--foreground [--take-over] | --stop | --hand-over]\n"
+    "Usage: %s [--foreground [--take-over] | --stop | --hand-over | --make-locks]\n"
     "Keeps the %s port mappings of the router in line with /etc/portforward/rule.conf.\n"
     "Without arguments it goes into the background, where a parent starts it again after a crash.\n"
     "\n"
@@ -42,6 +44,7 @@ constexpr char kHelp[] =
     "  --take-over   have one that runs already end and leave its mappings to this one\n"
     "  --stop        end the one that runs, and take the mappings away\n"
     "  --hand-over   end the one that runs, and leave the mappings in the router\n"
+    "  --make-locks  make the lock files in /tmp, also in the place of what others have put there\n"
     "  --help        this text\n"
     "\n"
     "SIGHUP reads the rules again; SIGTERM takes the mappings away and ends; SIGUSR1 ends and leaves them.\n"
@@ -93,9 +96,13 @@ Descriptor Detach() {
     return Descriptor(rgFd[1]);
 }
 
-void Withdraw(Mapper& mapper) {
+bool Withdraw(Mapper& mapper) {
     const auto end = Clock::now() + kWithdrawLimit;
-    mapper.Withdraw([end] { return Clock::now() > end; });
+    const bool blGone = mapper.Withdraw([end] { return Clock::now() > end; });
+    if (!blGone) {
+        syslog(LOG_ERR, "the router could not be asked to take the mappings away; it may keep them");
+    }
+    return blGone;
 }
 
 // Tells the service manager, where one started us, that the work has begun. Our own children have nothing to tell it.
@@ -228,10 +235,15 @@ void Frame::Loop() {
 
 // The locks of saves, detections and tests, before anybody else can put something of his own in their places: a link,
 // or a file that he holds.
-void MakeLockFiles() {
+int MakeLockFiles() {
+    int nExit = 0;
     for (const char* szPath : kLockFiles) {
-        Descriptor(open(szPath, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kPrivateMode));
+        if (!MakeOwnFile(szPath)) {
+            syslog(LOG_ERR, "cannot make %s: %s", szPath, std::strerror(errno));
+            nExit = 1;
+        }
     }
+    return nExit;
 }
 
 int AnotherRuns(const DaemonNames& names) {
@@ -274,19 +286,25 @@ int RunInBackground(Mapper& mapper, char* szTitle) {
 int StopRunning(Mapper& mapper) {
     const DaemonNames& names = mapper.Names();
     Instance instance(names.szLockFile);
+    bool blGone = true;
     if (instance.Take()) {  // nobody ran; one that was killed may have left its mappings
-        if (mapper.IsSwitchedOn()) {
-            Withdraw(mapper);
-        }
+        blGone = !mapper.IsSwitchedOn() || Withdraw(mapper);
         unlink(names.szPidFile);
         instance.Forget();
     }
-    return EndRunning(names, SIGTERM) ? 0 : 1;
+    return EndRunning(names, SIGTERM) && blGone ? 0 : 1;
 }
 
 int RunDaemon(Mapper& mapper, std::string_view szOptions, char* szTitle) {
     const DaemonNames& names = mapper.Names();
-    openlog(names.szName, LOG_PID, LOG_DAEMON);
+    openlog(names.szName, LOG_PID | (szOptions == "--stop " ? LOG_PERROR : 0), LOG_DAEMON);
+    if (geteuid() != 0) {
+        std::fprintf(stderr, "%s: only root can do this: run it with sudo\n", names.szName);
+        return 1;
+    }
+    if (szOptions == "--make-locks ") {
+        return MakeLockFiles();
+    }
     if (szOptions.empty()) {
         return RunInBackground(mapper, szTitle);
     }
@@ -315,8 +333,8 @@ int DaemonMain(int argc, char** argv, Mapper& mapper) {
         PrintHelp(stdout, mapper.Names());
         return 0;
     }
-    constexpr std::string_view kOptions[] = {"", "--foreground ", "--foreground --take-over ", "--stop ",
-                                             "--hand-over "};
+    constexpr std::string_view kOptions[] = {"",        "--foreground ", "--foreground --take-over ",
+                                             "--stop ", "--hand-over ",  "--make-locks "};
     if (std::find(std::begin(kOptions), std::end(kOptions), szOptions) == std::end(kOptions)) {
         std::fprintf(stderr, "%s: unknown arguments '%s'\n\n", mapper.Names().szName, szOptions.c_str());
         PrintHelp(stderr, mapper.Names());

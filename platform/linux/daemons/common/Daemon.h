@@ -29,8 +29,8 @@ public:
     virtual int Run(bool blRequested, const std::function<bool()>& fnStop) = 0;
     // Whether the settings have this daemon map at all; if not, the marker is the other daemon's.
     virtual bool IsSwitchedOn() const = 0;
-    // Takes away every mapping that we made.
-    virtual void Withdraw(const std::function<bool()>& fnStop) = 0;
+    // Takes away every mapping that we made. False: some may be left in the router.
+    virtual bool Withdraw(const std::function<bool()>& fnStop) = 0;
     // A descriptor on which the router may speak of its own accord, or -1; and, when it did, whether
     // what it said is a reason for a pass now.
     virtual int WakeFd() const { return -1; }
@@ -38,7 +38,8 @@ public:
 };
 
 // A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM, SIGINT or
-// SIGUSR1. Exit status: 0; 1 when another instance runs or nothing could be started; 2 for a wrong argument.
+// SIGUSR1. Exit status: 0; 1 when another instance runs, or what was asked for could not be done; 2 for a wrong
+// argument.
 int DaemonMain(int argc, char** argv, Mapper& mapper);
 
 }  // namespace tavo

@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <array>
+#include <cerrno>
 #include <charconv>
 
 #include "core/TextFile.h"
@@ -41,7 +42,10 @@ bool Instance::Take() {
 
 pid_t Instance::Holder() const {
     const Descriptor fd = Open(mSzLockFile, O_RDONLY);
-    if (fd.Get() < 0 || flock(fd.Get(), LOCK_SH | LOCK_NB) == 0) {
+    if (fd.Get() < 0) {
+        return errno == ENOENT ? 0 : -1;
+    }
+    if (flock(fd.Get(), LOCK_SH | LOCK_NB) == 0) {
         return 0;
     }
     std::array<char, kPidSize> rgText = {};

@@ -251,19 +251,20 @@ void RuleMapper::TellNews(const Published& state, bool blRequested) {
     mTold.Save();
 }
 
-void RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
+bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
     Unpublish(mNames.szName);
     if (!mTurn.Take([] { return false; })) {
-        return;
+        return true;  // without the turn, nothing was made
     }
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = Map({}, false, fnStop);
         if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
             mTold.Get().blWithdrawn = true;
             mTold.Save();
-            return;
+            return true;
         }
     }
+    return false;
 }
 
 }  // namespace tavo

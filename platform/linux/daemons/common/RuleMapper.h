@@ -27,7 +27,7 @@ public:
     const DaemonNames& Names() const final { return mNames; }
     int Run(bool blRequested, const std::function<bool()>& fnStop) final;
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
-    void Withdraw(const std::function<bool()>& fnStop) final;
+    bool Withdraw(const std::function<bool()>& fnStop) final;
 
 protected:
     // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked

@@ -61,6 +61,9 @@ const char* Objection(int fdDirectory, const std::string& szName) {
 // In the child: a process group of its own, nothing open but its output, no shell.
 [[noreturn]] void BecomeHook(const std::string& szPath, char* const* rgszEnvironment, int fdOutput) {
     setpgid(0, 0);
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
     for (int nSignal = 1; nSignal < NSIG; ++nSignal) {
         signal(nSignal, SIG_DFL);
     }
@@ -93,10 +96,11 @@ bool HasEnded(pid_t pid) {
     return waitid(P_PID, static_cast<id_t>(pid), &info, WEXITED | WNOHANG | WNOWAIT) != 0 || info.si_pid == pid;
 }
 
-// Whether the child has ended by then. What it says is taken in the meantime.
-bool WaitUntil(pid_t pid, int fdOutput, Clock::time_point end, std::string& szOutput) {
+// Whether the child has ended by then, or before fnStop. What it says is taken in the meantime.
+bool WaitUntil(pid_t pid, int fdOutput, Clock::time_point end, const std::function<bool()>& fnStop,
+               std::string& szOutput) {
     bool blEnded = HasEnded(pid);
-    while (!blEnded && Clock::now() < end) {
+    while (!blEnded && Clock::now() < end && !fnStop()) {
         pollfd output = {fdOutput, POLLIN, 0};
         poll(&output, 1, static_cast<int>(kTick.count()));
         if (output.revents != 0 && !TakeOutput(fdOutput, szOutput) && (output.revents & (POLLHUP | POLLERR)) != 0) {
@@ -142,7 +146,8 @@ std::vector<std::string> FindHooks(const std::string& szDirectory, std::vector<s
     return rgszHooks;
 }
 
-HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFacts, std::chrono::milliseconds limit) {
+HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFacts, std::chrono::milliseconds limit,
+                const std::function<bool()>& fnStop) {
     std::vector<char*> rgszEnvironment = {const_cast<char*>(kPath)};
     for (const std::string& szFact : rgFacts) {
         rgszEnvironment.push_back(const_cast<char*>(szFact.c_str()));
@@ -166,10 +171,11 @@ HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFac
     }
     end.blStarted = true;
     std::string szOutput;
-    end.blInTime = WaitUntil(pid, fdRead.Get(), Clock::now() + limit, szOutput);
+    end.blInTime = WaitUntil(pid, fdRead.Get(), Clock::now() + limit, fnStop, szOutput);
     if (!end.blInTime) {
         kill(-pid, SIGTERM);
-        WaitUntil(pid, fdRead.Get(), Clock::now() + kKillAfter, szOutput);
+        WaitUntil(
+            pid, fdRead.Get(), Clock::now() + kKillAfter, [] { return false; }, szOutput);
         kill(-pid, SIGKILL);  // also who of its group is left
     }
     int nStatus = 0;

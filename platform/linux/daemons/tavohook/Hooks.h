@@ -4,6 +4,7 @@
 #pragma once
 
 #include <chrono>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -21,7 +22,8 @@ struct HookEnd {
 };
 
 // Runs a program with rgFacts ("NAME=value") and a PATH as its whole environment, and waits for its end. One that
-// takes longer than the limit is ended with all its process group.
-HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFacts, std::chrono::milliseconds limit);
+// takes longer than the limit, or runs when fnStop says so, is ended with all its process group.
+HookEnd RunHook(const std::string& szPath, const std::vector<std::string>& rgFacts, std::chrono::milliseconds limit,
+                const std::function<bool()>& fnStop);
 
 }  // namespace tavo

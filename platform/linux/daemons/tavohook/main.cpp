@@ -1,8 +1,7 @@
 // tavohook: runs the administrator's hooks, one after another, for the daemons or for somebody who tries them.
 // Relies on Hooks, and on a socket as standard input on which each message is one notice. Promises: see --help;
-// ends soon after the daemon that started it.
+// ends soon after the daemon that started it, and with the hook that runs when it is told to.
 #include <poll.h>
-#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <syslog.h>
@@ -10,12 +9,14 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <cstdio>
 #include <set>
 #include <string>
 #include <string_view>
 
 #include "daemons/common/HookQueue.h"
+#include "daemons/common/SignalQueue.h"
 #include "daemons/tavohook/Hooks.h"
 
 namespace {
@@ -42,6 +43,7 @@ public:
 private:
     bool IsTooLate();
 
+    tavo::SignalQueue mSignals;
     bool mBlFollow = false;
     std::set<std::string> mSetRefused;  // said once
     Clock::time_point mEnd = Clock::time_point::max();
@@ -60,8 +62,11 @@ int Runner::RunAll(const std::vector<std::string>& rgFacts) {
         if (IsTooLate()) {
             return 1;
         }
-        const tavo::HookEnd end = tavo::RunHook(std::string(tavo::kHookDirectory) + "/" + szName, rgFacts, kHookLimit);
-        if (!end.blStarted) {
+        const tavo::HookEnd end = tavo::RunHook(std::string(tavo::kHookDirectory) + "/" + szName, rgFacts, kHookLimit,
+                                                [this] { return mSignals.IsStop(); });
+        if (mSignals.IsStop()) {
+            syslog(LOG_WARNING, "hook %s: ended because tavohook was told to end", szName.c_str());
+        } else if (!end.blStarted) {
             syslog(LOG_ERR, "hook %s: it could not be started", szName.c_str());
         } else if (!end.blInTime) {
             syslog(LOG_WARNING, "hook %s: ended because it took longer than 30 seconds", szName.c_str());
@@ -82,7 +87,7 @@ bool Runner::IsTooLate() {
     if (mBlFollow && mEnd == Clock::time_point::max() && poll(&waiting, 1, 0) > 0) {
         mEnd = Clock::now() + kAfterlife;
     }
-    return Clock::now() > mEnd;
+    return mSignals.IsStop() || Clock::now() > mEnd;
 }
 
 // Each message is one notice; none comes any more when the daemon has ended.
@@ -90,7 +95,16 @@ int Runner::Follow() {
     mBlFollow = true;
     std::array<char, tavo::kMaxHookFacts> rgBytes;
     ssize_t nSize = 0;
-    while (!IsTooLate() && (nSize = recv(STDIN_FILENO, rgBytes.data(), rgBytes.size(), 0)) > 0) {
+    pollfd rgWaiting[] = {mSignals.Waiting(), {STDIN_FILENO, POLLIN, 0}};
+    while (!IsTooLate()) {
+        mSignals.Wait(rgWaiting, -1);
+        nSize = recv(STDIN_FILENO, rgBytes.data(), rgBytes.size(), MSG_DONTWAIT);
+        if (nSize < 0 && errno == EAGAIN) {
+            continue;
+        }
+        if (nSize <= 0) {
+            break;
+        }
         std::vector<std::string> rgFacts;
         for (std::string_view szLeft(rgBytes.data(), static_cast<size_t>(nSize)); !szLeft.empty();) {
             const size_t nEnd = std::min(szLeft.find('\0'), szLeft.size() - 1);
@@ -119,7 +133,6 @@ std::vector<std::string> TryFacts(std::vector<std::string> rgFacts) {
 int main(int argc, char** argv) {
     const std::string_view szVerb = argc > 1 ? argv[1] : "";
     umask(022);
-    signal(SIGCHLD, SIG_DFL);  // the ends of hooks are told to nobody else
     if (szVerb == "--follow" && argc == 2) {
         openlog("tavohook", LOG_PID, LOG_DAEMON);
         return Runner().Follow();
