@@ -14,7 +14,8 @@ namespace tavo::cli {
 
 namespace {
 
-constexpr off_t kMostBytes = 4 << 20;
+constexpr size_t kMostOwnBytes = 64U << 20U;    // the rules twice, in JSON: a rule file has 16 MiB at most
+constexpr size_t kMostUsersBytes = 16U << 20U;  // as many rules as a rule file holds
 constexpr mode_t kOwnerOnly = 0600;
 
 class File {
@@ -36,7 +37,7 @@ private:
 
 bool IsOwn(const struct stat& status) {
     return S_ISREG(status.st_mode) && (status.st_uid == 0 || status.st_uid == geteuid()) &&
-           (status.st_mode & (S_IWGRP | S_IWOTH)) == 0 && status.st_size <= kMostBytes;
+           (status.st_mode & (S_IWGRP | S_IWOTH)) == 0 && static_cast<size_t>(status.st_size) <= kMostOwnBytes;
 }
 
 bool WriteAll(int fd, const std::string& szText) {
@@ -76,13 +77,16 @@ ReadState ReadOwnFile(const std::string& szPath, std::string& szText) {
 std::optional<std::string> ReadUsersFile(const std::string& szPath) {
     std::ifstream file(szPath);
     std::istream& stream = szPath == "-" ? std::cin : file;
-    std::string szText(kMostBytes + 1, '\0');
-    stream.read(szText.data(), kMostBytes + 1);
+    std::string szText(kMostUsersBytes + 1, '\0');
+    stream.read(szText.data(), kMostUsersBytes + 1);
     szText.resize(static_cast<size_t>(stream.gcount()));
     return stream.eof() && !stream.bad() ? std::optional(szText) : std::nullopt;
 }
 
 bool WriteOwnFile(const std::string& szPath, const std::string& szText) {
+    if (szText.size() > kMostOwnBytes) {
+        return false;
+    }
     const std::string szNew = szPath + ".new";
     unlink(szNew.c_str());  // of a writer that was killed
     File file(open(szNew.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kOwnerOnly));

@@ -295,6 +295,12 @@ class Tool(unittest.TestCase):
             self.saved()
             self.assertFalse(os.path.exists(DRAFT))
 
+    def test_a_draft_of_as_many_rules_as_a_file_holds(self):
+        rules = [(1, "tcp", port, port, f"rule number {port}") for port in range(1, 16001)]
+        self.store(*rules)
+        self.expect("rules remove 7", OK, "noted")
+        self.assertEqual(len(self.rows()), 15999)
+
     def in_force(self):
         """What a daemon reads, whatever edits wait."""
         hidden = DRAFT + ".hidden"
