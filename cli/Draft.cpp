@@ -3,9 +3,12 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <map>
+#include <set>
 
 #include "Box.h"
 #include "JsonText.h"
+#include "PortPairs.h"
 #include "RuleStore.h"
 #include "TextFile.h"
 
@@ -104,14 +107,39 @@ std::optional<Rules> FromFile(const Json::Value& jsRules) {
 
 // ---- comparing ---------------------------------------------------------------------------------------------
 
-bool IsSameList(const std::string& szOne, const std::string& szOther) {
-    const auto rgOne = ParsePorts(szOne);
-    return rgOne ? rgOne == ParsePorts(szOther) : szOne == szOther;
+// What two rules have in common when they are the same in this way. Keys are sorted instead of every rule being held
+// against every other one: a file may have tens of thousands.
+using Key = std::vector<std::string>;
+
+// A text that every spelling of a list has in common; one that cannot be read is like itself only.
+std::string ListKey(const std::string& szList) {
+    const auto rgPorts = ParsePorts(szList);
+    return rgPorts ? PortsText(*rgPorts) : "?" + szList;
+}
+
+Key ForwardKey(const Rule& rule) {
+    return {rule.szProtocol, ListKey(rule.szRouterPorts), ListKey(rule.szBoxPorts)};
+}
+
+Key ContentKey(const Rule& rule) {
+    Key key = ForwardKey(rule);
+    key.insert(key.end(), {rule.blEnabled ? "on" : "off", rule.szName, rule.szServiceId});
+    return key;
+}
+
+Key IdKey(const Rule& rule) {
+    return {rule.szId};
+}
+
+Key WholeKey(const Rule& rule) {
+    Key key = ContentKey(rule);
+    key.push_back(rule.szId);
+    return key;
 }
 
 bool IsSameForward(const Rule& one, const Rule& other) {
-    return one.szProtocol == other.szProtocol && IsSameList(one.szRouterPorts, other.szRouterPorts) &&
-           IsSameList(one.szBoxPorts, other.szBoxPorts);
+    const bool blSpelledAlike = one.szRouterPorts == other.szRouterPorts && one.szBoxPorts == other.szBoxPorts;
+    return one.szProtocol == other.szProtocol && (blSpelledAlike || ForwardKey(one) == ForwardKey(other));
 }
 
 bool IsSameSet(const Rules& one, const Rules& other) {
@@ -120,18 +148,23 @@ bool IsSameSet(const Rules& one, const Rules& other) {
     });
 }
 
-// Pairs rules off, each at most once: by the first test as far as it goes, then by the next.
-std::vector<size_t> Pair(const Rules& one, const Rules& other,
-                         std::initializer_list<bool (*)(const Rule&, const Rule&)> rgTests) {
+// Pairs rules off, each at most once: by the first key as far as it goes, then by the next.
+std::vector<size_t> Pair(const Rules& one, const Rules& other, std::initializer_list<Key (*)(const Rule&)> rgKeys) {
     std::vector<size_t> rgFellows(one.size(), kNone);
     std::vector<bool> rgTaken(other.size(), false);
-    for (const auto pfnTest : rgTests) {
-        for (size_t i = 0; i < one.size(); ++i) {
-            for (size_t j = 0; j < other.size() && rgFellows[i] == kNone; ++j) {
-                if (!rgTaken[j] && pfnTest(one[i], other[j])) {
-                    rgFellows[i] = j;
-                    rgTaken[j] = true;
-                }
+    for (const auto pfnKey : rgKeys) {
+        std::map<Key, std::vector<size_t>> mapFree;  // the first of them last
+        for (size_t j = other.size(); j-- > 0;) {
+            if (!rgTaken[j]) {
+                mapFree[pfnKey(other[j])].push_back(j);
+            }
+        }
+        for (size_t i = 0; i < one.size() && !mapFree.empty(); ++i) {
+            const auto it = rgFellows[i] == kNone ? mapFree.find(pfnKey(one[i])) : mapFree.end();
+            if (it != mapFree.end() && !it->second.empty()) {
+                rgFellows[i] = it->second.back();
+                rgTaken[rgFellows[i]] = true;
+                it->second.pop_back();
             }
         }
     }
@@ -154,16 +187,33 @@ Rule Merged(const Rule& base, const Rule& edited, const Rule& current) {
     return merged;
 }
 
-// A rule that only the edits have, unless somebody else has made the same one.
-void Append(Rule rule, Rules& rules) {
-    if (std::any_of(rules.begin(), rules.end(), [&](const Rule& there) { return IsSameContent(there, rule); })) {
-        return;
+// Rules that come together, and what has to be known of them to add one more.
+class Gathered {
+public:
+    void Take(Rule rule) {
+        mSetIds.insert(rule.szId);
+        mSetContents.insert(ContentKey(rule));
+        mNLast = std::max(mNLast, NumberOf(rule.szId));
+        mRules.push_back(std::move(rule));
     }
-    if (std::any_of(rules.begin(), rules.end(), [&](const Rule& there) { return there.szId == rule.szId; })) {
-        rule.szId = NextId(rules);
+    // A rule that only the edits have, unless somebody else has made the same one.
+    void Append(Rule rule) {
+        if (mSetContents.count(ContentKey(rule)) > 0) {
+            return;
+        }
+        if (mSetIds.count(rule.szId) > 0) {
+            rule.szId = std::to_string(mNLast + 1);
+        }
+        Take(std::move(rule));
     }
-    rules.push_back(std::move(rule));
-}
+    const Rules& All() const { return mRules; }
+
+private:
+    Rules mRules;
+    std::set<std::string> mSetIds;
+    std::set<Key> mSetContents;
+    int mNLast = 0;
+};
 
 bool IsEveryRuleOff() {
     const auto inForce = LoadRules();
@@ -178,37 +228,33 @@ bool IsSameContent(const Rule& one, const Rule& other) {
 }
 
 std::vector<size_t> Fellows(const Rules& one, const Rules& other) {
-    return Pair(
-        one, other,
-        {[](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId && IsSameContent(rule, fellow); },
-         [](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId; }});
+    return Pair(one, other, {&WholeKey, &IdKey});
 }
 
 Rules Rebase(const Rules& base, const Rules& edited, const Rules& current) {
-    const std::vector<size_t> rgBase = Pair(
-        current, base,
-        {[](const Rule& rule, const Rule& fellow) { return rule.szId == fellow.szId && IsSameContent(rule, fellow); },
-         &IsSameContent, &IsSameForward});
+    const std::vector<size_t> rgBase = Pair(current, base, {&WholeKey, &ContentKey, &ForwardKey});
     const std::vector<size_t> rgEdited = Fellows(base, edited);
     const std::vector<size_t> rgOrigin = Fellows(edited, base);
-    Rules rules;
+    std::vector<bool> rgIsThere(base.size(), false);
+    Gathered rules;
     for (size_t i = 0; i < current.size(); ++i) {
         if (rgBase[i] == kNone) {
-            rules.push_back(current[i]);
-        } else if (const size_t nEdited = rgEdited[rgBase[i]]; nEdited != kNone) {
-            rules.push_back(Merged(base[rgBase[i]], edited[nEdited], current[i]));
+            rules.Take(current[i]);
+            continue;
+        }
+        rgIsThere[rgBase[i]] = true;
+        if (const size_t nEdited = rgEdited[rgBase[i]]; nEdited != kNone) {
+            rules.Take(Merged(base[rgBase[i]], edited[nEdited], current[i]));
         }
     }
     for (size_t i = 0; i < edited.size(); ++i) {
         const size_t nBase = rgOrigin[i];
         // What others removed is gone, unless the user has changed it.
-        const bool blOnlyHere = nBase == kNone || (std::count(rgBase.begin(), rgBase.end(), nBase) == 0 &&
-                                                   !IsSameContent(base[nBase], edited[i]));
-        if (blOnlyHere) {
-            Append(edited[i], rules);
+        if (nBase == kNone || (!rgIsThere[nBase] && !IsSameContent(base[nBase], edited[i]))) {
+            rules.Append(edited[i]);
         }
     }
-    return rules;
+    return rules.All();
 }
 
 // ---- the draft ---------------------------------------------------------------------------------------------

@@ -136,12 +136,16 @@ std::vector<Overlap> OverlapsOf(const Rules& rules) {
     return rgFound;
 }
 
+int NumberOf(const std::string& szId) {
+    int nId = 0;
+    std::from_chars(szId.data(), szId.data() + szId.size(), nId);
+    return nId < kMaxNumber ? std::max(nId, 0) : 0;
+}
+
 std::string NextId(const Rules& rules) {
     int nLast = 0;
     for (const Rule& rule : rules) {
-        int nId = 0;
-        std::from_chars(rule.szId.data(), rule.szId.data() + rule.szId.size(), nId);
-        nLast = nId < kMaxNumber ? std::max(nLast, nId) : nLast;
+        nLast = std::max(nLast, NumberOf(rule.szId));
     }
     return std::to_string(nLast + 1);
 }

@@ -64,6 +64,8 @@ extern const char kUnreadable[];
 
 Json::Value ToJson(const Rule& rule);
 
+// The number that an id is or begins with; 0 for none, and for one that needs no successor.
+int NumberOf(const std::string& szId);
 // The id after the highest number.
 std::string NextId(const Rules& rules);
 

@@ -296,10 +296,12 @@ class Tool(unittest.TestCase):
             self.assertFalse(os.path.exists(DRAFT))
 
     def test_a_draft_of_as_many_rules_as_a_file_holds(self):
-        rules = [(1, "tcp", port, port, f"rule number {port}") for port in range(1, 16001)]
-        self.store(*rules)
+        rules = lambda first: [(1, "tcp", first + i, first + i, f"rule number {i}") for i in range(16000)]
+        self.store(*rules(1))
         self.expect("rules remove 7", OK, "noted")
         self.assertEqual(len(self.rows()), 15999)
+        self.store(*rules(20001))  # no rule is like any other one
+        self.assertEqual(len(self.rows()), 16000)
 
     def in_force(self):
         """What a daemon reads, whatever edits wait."""
