@@ -83,7 +83,7 @@ Reply Update(int& nVersion) {
         return {};
     }
     return Failure(fmt::format("the router descriptions could not be updated, and the old ones stay: {}",
-                               *TAVOPFRouterDBWhy() == '\0' ? "the system log says why" : TAVOPFRouterDBWhy()));
+                               *TAVOPFRouterDBWhy() == '\0' ? "the system log says why" : Clean(TAVOPFRouterDBWhy())));
 }
 
 Reply Routers(const Wish& wish) {

@@ -1123,7 +1123,9 @@ class Tool(unittest.TestCase):
             self.assertEqual([router["model"] for router in self.json("routers", *search)[1]["routers"]], models)
         self.expect("routers nothere", OK, "none of the 3 known routers matches")
         put("/etc/tavo/platform.conf", '[download]\ndatabase_url="http://127.0.0.1:1"\n[other]\n[download]\n')
-        self.expect("routers --update", FAILED, "could not be updated, and the old ones stay: \\S")
+        put("/usr/tavo/bin/wget", "#!/bin/sh\nprintf 'no\\302\\233route\\342\\200\\256\\n' >&2\nexit 4\n")
+        os.chmod("/usr/tavo/bin/wget", 0o755)
+        self.expect("routers --update", FAILED, r"could not be updated, and the old ones stay: no\\u\{9b\}route\\u\{202e\}\n")
         os.unlink("/etc/tavo/platform.conf")
 
     def test_models_of_the_owner(self):
