@@ -14,6 +14,7 @@
 #include "OpenPort.h"
 #include "PortNames.h"
 #include "Published.h"
+#include "Reach.h"
 #include "RuleImport.h"
 #include "SaveRules.h"
 #include "Setup.h"
@@ -21,13 +22,10 @@
 #include "Table.h"
 #include "Test.h"
 #include "Usage.h"
-#include "tavo/core.h"
 
 namespace tavo::cli {
 
 namespace {
-
-constexpr size_t kUrlSize = 1024;
 
 struct OpenWish {
     std::string szWhat;
@@ -172,12 +170,6 @@ std::string AddressToTry(const Rule& rule, const std::string& szOutside) {
     return blTcp && nPort == 443 ? "https://" + szOutside + "/" : fmt::format("{}:{}", szOutside, nPort);
 }
 
-bool IsCheckerNamed() {
-    char szUrl[kUrlSize];
-    TLIBPlatformSettingGet("portcheck", "url", "", szUrl, sizeof(szUrl));
-    return *szUrl != '\0';
-}
-
 // What a stranger meets: by the checker's word, else where to try it oneself.
 void AddOutside(const Rule& rule, bool blJson, Reply& reply) {
     const std::string szOutside = Outside();
@@ -194,7 +186,7 @@ void AddOutside(const Rule& rule, bool blJson, Reply& reply) {
     }
     reply.jsAnswer["outside_kind"] = ToWord(ReachOf(szOutside));
     reply.jsAnswer["tested"] = Json::Value();
-    if (!IsCheckerNamed()) {
+    if (CheckerUrl().empty()) {
         reply.szBody += Wrap(
             "try it from elsewhere, such as a phone without Wi-Fi; nobody outside was asked, as no port checker is "
             "named ('tavoportmap test --help')\n",

@@ -1,4 +1,4 @@
-// The table of tested ports. Relies on fmt. Promises: see Reach.h.
+// The table of tested ports. Relies on fmt and on the platform's settings. Promises: see Reach.h.
 #include "Reach.h"
 
 #include <fmt/format.h>
@@ -6,6 +6,7 @@
 #include <algorithm>
 
 #include "Table.h"
+#include "tavo/core.h"
 
 namespace tavo::cli {
 
@@ -16,7 +17,8 @@ enum Status : int { kNotTested = 0, kDisabled = 1, kOpen = 2, kClosed = 3 };
 constexpr char kAdviceClosed[] =
     "closed from outside: have the rules been written ('tavoportmap save')? Then it is another router on the way "
     "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
-constexpr char kAdviceNoJudge[] =
+constexpr size_t kUrlSize = 1024;
+constexpr char kAdviceNoChecker[] =
     "whether a port is open can only be told from outside, by a port checker: tavoportcheckd on a host elsewhere, "
     "named as url in [portcheck] of /etc/tavo/platform.conf";
 
@@ -66,6 +68,29 @@ std::string UsualReason(const PortVerdict& verdict) {
     }
 }
 
+// What the tester found wrong with the checker, not with a port; empty when nothing.
+std::string FaultOfChecker(const std::vector<PortVerdict>& rgVerdicts) {
+    for (const PortVerdict& verdict : rgVerdicts) {
+        const size_t nAt = verdict.szReason.find("the port checker ");
+        if (verdict.enStatus == kNotTested && nAt != std::string::npos) {
+            return verdict.szReason.substr(nAt, verdict.szReason.find(';', nAt) - nAt);  // other ports may follow
+        }
+    }
+    return "";
+}
+
+// What can be done about ports that could not be judged; empty where the table says it.
+std::string AdviceNoJudge(const std::vector<PortVerdict>& rgVerdicts) {
+    const std::string szUrl = CheckerUrl();
+    if (szUrl.empty()) {
+        return kAdviceNoChecker;
+    }
+    const std::string szFault = FaultOfChecker(rgVerdicts);
+    return szFault.empty() ? ""
+                           : fmt::format("{}; it is {}, named as url in [portcheck] of /etc/tavo/platform.conf",
+                                         szFault, Clean(szUrl));
+}
+
 std::string PortWords(const PortVerdict& verdict) {
     const std::string szPorts = verdict.szRouterPorts + "/" + verdict.szProtocol;
     return Clean(verdict.szBoxPorts == verdict.szRouterPorts ? szPorts : szPorts + " to " + verdict.szBoxPorts);
@@ -84,6 +109,12 @@ Json::Value ToJson(const PortVerdict& verdict) {
 }
 
 }  // namespace
+
+std::string CheckerUrl() {
+    char szUrl[kUrlSize];
+    TLIBPlatformSettingGet("portcheck", "url", "", szUrl, sizeof(szUrl));
+    return szUrl;
+}
 
 void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog) {
     const std::vector<std::string> rgszWords = LoggedWords(szLog);
@@ -115,8 +146,8 @@ void DescribePorts(const std::vector<PortVerdict>& rgVerdicts, Reply& reply) {
         blUnjudged = blUnjudged || (verdict.enStatus == kNotTested && !verdict.blNobodyListens);
     }
     reply.szBody += table.ToText();
-    if (blUnjudged) {
-        reply.rgszWarnings.emplace_back(kAdviceNoJudge);
+    if (const std::string szAdvice = AdviceNoJudge(rgVerdicts); blUnjudged && !szAdvice.empty()) {
+        reply.rgszWarnings.push_back(szAdvice);
     }
     if (blClosed) {
         reply.rgszWarnings.emplace_back(kAdviceClosed);

@@ -21,6 +21,9 @@ struct PortVerdict {
     std::string szReason = {};     // in the tester's own words, where it has some
 };
 
+// The port checker that the settings name; empty where they name none.
+std::string CheckerUrl();
+
 // Gives each verdict its reason. szLog: what the library logged while it tested them, in this order.
 void AddReasons(std::vector<PortVerdict>& rgVerdicts, const std::string& szLog);
 

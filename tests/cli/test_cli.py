@@ -733,7 +733,8 @@ class Tool(unittest.TestCase):
         # The library itself, with no checker named anywhere.
         self.expect("test 2 3", FAILED, r"2 dns +53/udp +not tested(?s:.)*tavoportcheckd(?s:.)*\[portcheck\]")
         put("/etc/tavo/platform.conf", '[portcheck]\nurl="http://127.0.0.1:1"\ntoken="0123456789abcdef"\n')
-        self.expect("test 2", REFUSED, r"nobody listens on port 53 of this box\n(?s:.)*53/udp +not tested +the port checker cannot be reached")
+        self.expect("test 2", REFUSED, r"nobody listens on port 53 of this box\n(?s:.)*53/udp +not tested +the port checker cannot be reached"
+                    r"(?!(?s:.)*tavoportcheckd)(?s:.)*warning: .*cannot be reached by IPv4; it is http://127.0.0.1:1, named as url")
         os.unlink("/etc/tavo/platform.conf")
         self.expect("test 7", USAGE, "there is no rule 7; the rules are 1, 2, 3")
 

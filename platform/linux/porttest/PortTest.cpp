@@ -201,8 +201,9 @@ bool Test::AskAbout(const std::vector<Item*>& rgItems, Arrivals& arrivals) {
     std::transform(rgItems.begin(), rgItems.end(), std::back_inserter(rgPorts),
                    [](const Item* pItem) { return pItem->Asked(); });
     const int nLeft = MillisecondsLeft(mEnd);
-    const CheckerAnswer answer = nLeft > 0 ? mChecker.Ask(rgPorts, mSzProbe, mSzAnswer, nLeft)
-                                           : CheckerAnswer{{}, "not tested: the checker took too long over the others"};
+    const CheckerAnswer answer = nLeft > 0
+                                     ? mChecker.Ask(rgPorts, mSzProbe, mSzAnswer, nLeft)
+                                     : CheckerAnswer{{}, "not tested: the port checker took too long over the others"};
     for (size_t i = 0; i < rgItems.size(); ++i) {
         Item& item = *rgItems[i];
         item.verdict = answer.rgFindings.empty() ? PortVerdict{TAVO_PORT_UNKNOWN, answer.szReason}
