@@ -1,11 +1,12 @@
-// Names and risks of ports. Relies on getservbyname. Promises: see PortNames.h.
+// Names and risks of ports. Relies on /etc/services. Promises: see PortNames.h.
 #include "PortNames.h"
 
-#include <arpa/inet.h>
 #include <fmt/format.h>
-#include <netdb.h>
 
 #include <algorithm>
+#include <charconv>
+#include <fstream>
+#include <sstream>
 
 #include "RuleStore.h"
 
@@ -80,15 +81,32 @@ std::optional<PortWish> ReadPreset(const std::string& szName) {
                : std::optional(PortWish{pPreset->szName, pPreset->szPorts, pPreset->szProtocol});
 }
 
+// The port of a line "name port/protocol aliases # remark" that is about this name and protocol. The system's own
+// reader (getservbyname) makes 4464 of 70000, a port that nobody has named: so the line is read here, and is none.
+std::optional<int> PortIn(const std::string& szLine, const std::string& szName, const std::string& szProtocol) {
+    std::istringstream words(szLine.substr(0, szLine.find('#')));
+    std::string szWord, szPort;
+    words >> szWord >> szPort;
+    bool blNamed = szWord == szName;
+    while (words >> szWord) {
+        blNamed = blNamed || szWord == szName;
+    }
+    int nPort = 0;
+    const auto [pRead, fault] = std::from_chars(szPort.data(), szPort.data() + szPort.size(), nPort);
+    const bool blPort = fault == std::errc() && nPort >= 1 && nPort <= UINT16_MAX;
+    return blNamed && blPort && pRead == "/" + szProtocol ? std::optional(nPort) : std::nullopt;
+}
+
 // A name that has both protocols in /etc/services is meant as TCP, unless UDP is said: nearly all of them have
 // only been registered for both.
 std::optional<PortWish> ReadService(const std::string& szName, const std::string& szProtocol) {
     for (const std::string& szTried :
          szProtocol.empty() ? std::vector<std::string>{"tcp", "udp"} : std::vector<std::string>{szProtocol}) {
-        const servent* pService = getservbyname(szName.c_str(), szTried.c_str());
-        const uint16_t nPort = pService == nullptr ? 0 : ntohs(static_cast<uint16_t>(pService->s_port));
-        if (nPort != 0) {
-            return PortWish{szName, std::to_string(nPort), szTried};
+        std::ifstream services("/etc/services");
+        for (std::string szLine; std::getline(services, szLine);) {
+            if (const auto nPort = PortIn(szLine, szName, szTried)) {
+                return PortWish{szName, std::to_string(*nPort), szTried};
+            }
         }
     }
     return std::nullopt;

@@ -1,5 +1,5 @@
 // What ports are for: names that a person says instead of numbers, and ports that should not face the world. Relies on
-// /etc/services (getservbyname) and on a handful of presets. Promises: a name stands for one protocol or for ports
+// /etc/services and on a handful of presets. Promises: a name stands for one protocol or for ports
 // whose protocol is certain.
 #pragma once
 

@@ -156,8 +156,6 @@ class Tool(unittest.TestCase):
 
     def test_rules_round_trip(self):
         self.expect("rules list", OK, "no rules are stored yet; 'tavoportmap open 443' (?s:.)*rules add web")
-        with open("/etc/services", "a", encoding="utf-8") as services:
-            services.write("zero 0/tcp\n")
         self.expect("rules add web --router-port 443 --box-port 8443", OK, "rule 1 noted, not in force yet")
         self.expect("rules add --name dns --protocol all --router-port 53,5000-5001 --disabled", OK, "rule 2 noted")
         self.expect("rules add --router-port 443", USAGE, "rule 1 already forwards router port 443/tcp")
@@ -168,7 +166,7 @@ class Tool(unittest.TestCase):
         self.expect("rules enable dns", OK, "noted")
         for which, code, pattern in (("3", OK, "noted"), ("3", USAGE, "there is no rule 3; the rules are 1, 2, 4"),
                                      ("450", USAGE, "rule 4 forwards more than '450'(?s:.)*tavoportmap close 450"),
-                                     ("http", USAGE, "there is no rule http"), ("zero", USAGE, "there is no rule zero")):
+                                     ("http", USAGE, "there is no rule http")):
             self.expect(f"rules remove {which}", code, pattern)
         self.assertEqual(self.rows(), [("1", True, "tcp", "443", "8443", "web"),
                                        ("2", True, "all", "53,5000-5001", "53,5000-5001", "dns"),
@@ -386,7 +384,12 @@ class Tool(unittest.TestCase):
         """Rules before, the command, its exit code and words, the rules in force then."""
         web, span = (1, "tcp", "443", "8443", "web"), (1, "all", "5000-5004", "5000-5004", "")
         off = lambda rule: (0, *rule[1:])
+        with open("/etc/services", "a", encoding="utf-8") as services:
+            services.write("zero 0/tcp\nodd 70000/tcp even\nother 7070/tcp even # odd\n")
         for before, command, code, pattern, after in (
+                ((), "open zero", USAGE, "'zero' is neither", ()),
+                ((), "open odd", USAGE, "'odd' is neither", ()),
+                ((), "open even", OK, "port 7070 .tcp.", ((1, "tcp", "7070", "7070", "even"),)),
                 ((), "open 443 --to 8443 --name web", OK, "port 443 .tcp. is open(?s:.)*leads to port 8443", (web,)),
                 ((web,), "open https --to 8443", OK, "was open on the router(?s:.)*already", (web,)),
                 ((off(web),), "open 443 --to 8443", OK, "is open", (web,)),
