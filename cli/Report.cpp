@@ -2,6 +2,8 @@
 // TLibUploadTestUpnpCompatibilityFailResult. Promises: a failure names what was missing, as far as that can be
 // seen, and where the archive is that was made.
 #include <fmt/format.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <charconv>
@@ -23,6 +25,14 @@ constexpr const char* kTestFiles[] = {"/tmp/upnp_test.progress", "/var/tmp/upnp_
                                       "/tmp/pfStatusRule"};
 constexpr std::string_view kArchiveEnd = ".tgz";
 
+// A file that this user has written since nBegin, under no other name. Anybody may put something into /tmp whose name
+// looks like the archive's.
+bool IsOwnSince(const std::filesystem::path& path, std::time_t nBegin) {
+    struct stat status = {};
+    return lstat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode) && status.st_uid == geteuid() &&
+           status.st_nlink == 1 && status.st_mtime >= nBegin;
+}
+
 // "/tmp/BRAND_SECONDS.tgz" of a time since nBegin; empty when there is none.
 std::string ArchiveSince(std::time_t nBegin) {
     std::error_code error;
@@ -35,7 +45,8 @@ std::string ArchiveSince(std::time_t nBegin) {
         std::time_t nMade = 0;
         const char* pEnd = szName.data() + szName.size() - kArchiveEnd.size();
         const auto [pRead, fault] = std::from_chars(szName.data() + nSeconds, pEnd, nMade);
-        if (fault == std::errc() && pRead == pEnd && nMade >= nBegin && nMade <= std::time(nullptr)) {
+        if (fault == std::errc() && pRead == pEnd && nMade >= nBegin && nMade <= std::time(nullptr) &&
+            IsOwnSince(entry.path(), nBegin)) {
             return entry.path().string();
         }
     }
@@ -93,7 +104,8 @@ Reply Report() {
     const std::string szArchive = ArchiveSince(nBegin);
     Reply reply;
     if (blSent) {
-        reply.szMessage = fmt::format("the report is sent; a copy stays in {}", Clean(szArchive));
+        reply.szMessage = "the report is sent";
+        reply.szMessage += szArchive.empty() ? "" : fmt::format("; a copy stays in {}", Clean(szArchive));
     } else if (szArchive.empty() && IsLocked()) {
         reply = Busy();
     } else {

@@ -5,6 +5,7 @@ stand_in.cpp, preloaded.
 """
 import contextlib
 import fcntl
+import itertools
 import json
 import os
 import pty
@@ -747,6 +748,14 @@ class Tool(unittest.TestCase):
         settings = KNOWN % ("yes", "no")
         put(ROUTER, settings)
         known = {"LD_PRELOAD": STAND_IN, "TAVO_LAST": "1 Acme"}
+        put("/tmp/written", "by root, in time\n")
+        for i, kind in itertools.product(range(5), ("link", "other", "old")):  # no archive of ours
+            planted = f"/tmp/{kind}_{int(time.time()) + i}.tgz"
+            if kind == "old":
+                put(planted, "x\n")
+                os.utime(planted, (0, 0))
+            else:
+                (os.symlink if kind == "link" else os.link)("/tmp/written", planted)
         self.expect("report", FAILED, "'tavoportmap detect' looks for it")
         self.expect("report", FAILED, "which this one is not(?s:.)*router.log", LD_PRELOAD=STAND_IN, TAVO_LAST="2 Acme")
         for path in files:
