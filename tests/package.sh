@@ -34,6 +34,10 @@ for szProgram in /usr/tavo/sbin/* /usr/tavo/bin/tavo* $(dpkg -L tavoportmap | gr
     ! ldd "$szProgram" | grep -q 'not found' || fail "$szProgram lacks a library"
     dpkg -L tavoportmap | grep -q "/man[18]/${szProgram##*/}\.[18]\.gz$" || fail "$szProgram has no manual page"
 done
+readonly szPage=$(dpkg-deb --fsys-tarfile tavoportmap_*.deb | tar -xO ./usr/share/man/man5/platform.conf.5.gz | zcat)
+for szKey in $(sed -n 's/^#\?\([a-z_]*\)=.*/\1/p' /etc/tavo/platform.conf); do
+    grep -q "^.fB$szKey.fP=" <<<"$szPage" || fail "the page of the settings does not know $szKey"
+done
 for szTool in curl wget; do
     "/usr/tavo/bin/$szTool" --version >/dev/null || fail "the library's $szTool does not run"
 done
