@@ -147,16 +147,17 @@ size_t SwitchOn(Rules& rules, const Rules& before) {
 
 Reply On(bool blJson) {
     const auto fnChange = [](Rules& rules) -> std::optional<Reply> {
-        const auto before = LoadOff();
-        if (!before && IsOffUnreadable()) {
+        Rules before;
+        const ReadState enState = ReadOff(before);
+        if (enState == ReadState::kUnreadable) {
             return Failure(
                 "what 'off' has switched off cannot be read (/etc/portforward/rules.off); 'tavoportmap rules list' "
                 "shows the rules, 'tavoportmap rules enable RULE' and 'tavoportmap save' open one again");
         }
-        if (!before) {
+        if (enState == ReadState::kAbsent) {
             return Reply{.szMessage = "nothing to switch on: nothing was switched off by 'tavoportmap off'"};
         }
-        if (SwitchOn(rules, *before) == 0) {
+        if (SwitchOn(rules, before) == 0) {
             DropOff();
             return Reply{.szMessage = "nothing to switch on: the rules that were switched off are gone"};
         }

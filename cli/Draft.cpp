@@ -312,15 +312,12 @@ Reply Unreadable() {
 
 // ---- off ---------------------------------------------------------------------------------------------------
 
-std::optional<Rules> LoadOff() {
+ReadState ReadOff(Rules& rules) {
     std::string szText;
-    return IsEveryRuleOff() && ReadOwnFile(kOff, szText) == ReadState::kRead ? FromFile(ObjectOf(szText)["rules"])
-                                                                             : std::nullopt;
-}
-
-bool IsOffUnreadable() {
-    std::string szText;
-    return IsEveryRuleOff() && !IsOff() && ReadOwnFile(kOff, szText) != ReadState::kAbsent;
+    const ReadState enState = IsEveryRuleOff() ? ReadOwnFile(kOff, szText) : ReadState::kAbsent;
+    const auto noted = enState == ReadState::kRead ? FromFile(ObjectOf(szText)["rules"]) : std::nullopt;
+    rules = noted.value_or(Rules());
+    return enState == ReadState::kRead && !noted ? ReadState::kUnreadable : enState;
 }
 
 bool StoreOff(const Rules& rules) {

@@ -6,9 +6,11 @@
 
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Answer.h"
+#include "TextFile.h"
 #include "libtavoportmap.h"
 
 namespace tavo::cli {
@@ -47,13 +49,15 @@ bool IsSameContent(const Rule& one, const Rule& other);
 // For each rule of one its fellow in other by id, and by content where an id stands twice; npos where there is none.
 std::vector<size_t> Fellows(const Rules& one, const Rules& other);
 
-// The rules that 'off' switched off; nothing when it did not, or when somebody has opened ports since.
-std::optional<Rules> LoadOff();
+// The rules that 'off' switched off; absent when it did not, or when somebody has opened ports since.
+ReadState ReadOff(Rules& rules);
+inline std::optional<Rules> LoadOff() {
+    Rules rules;
+    return ReadOff(rules) == ReadState::kRead ? std::optional(std::move(rules)) : std::nullopt;
+}
 inline bool IsOff() {
     return LoadOff().has_value();
 }
-// No rule is on, and what 'off' noted cannot be read.
-bool IsOffUnreadable();
 bool StoreOff(const Rules& rules);
 bool DropOff();
 
