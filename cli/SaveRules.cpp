@@ -16,6 +16,7 @@
 #include "Outcome.h"
 #include "Progress.h"
 #include "StoredRouter.h"
+#include "tavo/portforward.h"
 #include "tavo/runkeys.h"
 
 namespace tavo::cli {
@@ -172,11 +173,19 @@ std::optional<Reply> Refused(const StoredRouter& router, const std::string& szGa
     return Fits(router, szGateway, rules, result) ? std::nullopt : std::optional(Explain(result, router, rules.size()));
 }
 
-Reply TooLong() {
-    return Failure(
-        "a name or a port list of a rule is longer than 1023 bytes and would be cut: 'tavoportmap rules list' shows "
-        "it, "
-        "'rules edit' changes it. Nothing was changed");
+// What a rule file cannot hold, or nobody could read again.
+std::optional<Reply> Unwritable(const Rules& rules) {
+    if (rules.size() > TAVO_PF_MAX_SECTIONS) {
+        return Reply{.enExit = kTooMany,
+                     .szMessage = fmt::format("a rule file holds {} rules and there are {}. Nothing was changed",
+                                              static_cast<int>(TAVO_PF_MAX_SECTIONS), rules.size())};
+    }
+    if (!ToRecords(rules)) {
+        return Failure(
+            "a name or a port list of a rule is longer than 1023 bytes and would be cut: 'tavoportmap rules list' "
+            "shows it, 'rules edit' changes it. Nothing was changed");
+    }
+    return std::nullopt;
 }
 
 // A signal: once the rules are handed over, the daemon carries on by itself, and only the waiting ends.
@@ -240,7 +249,8 @@ Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, cons
 
 std::optional<Reply> WouldBeRefused(const StoredRouter& router, const std::string& szGateway, const Rules& rules) {
     SaveResult result = {};
-    return ToRecords(rules) ? Refused(router, szGateway, rules, result) : std::optional(TooLong());
+    const auto unwritable = Unwritable(rules);
+    return unwritable ? unwritable : Refused(router, szGateway, rules, result);
 }
 
 void AwaitDaemon() {
@@ -260,10 +270,10 @@ Reply SaveRules(const Rules& rules, bool blJson) {
         reply.enExit = kAway;
         return reply;
     }
-    auto rgRecords = ToRecords(rules);
-    if (!rgRecords) {
-        return TooLong();
+    if (const auto reply = Unwritable(rules)) {
+        return *reply;
     }
+    auto rgRecords = ToRecords(rules);
     SaveResult result = {};
     const StoredRouter router = ReadStoredRouter();
     const auto refused = Refused(router, *szGateway, rules, result);

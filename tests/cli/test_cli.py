@@ -301,6 +301,12 @@ class Tool(unittest.TestCase):
         self.assertEqual(len(self.rows()), 15999)
         self.store(*rules(20001))  # no rule is like any other one
         self.assertEqual(len(self.rows()), 16000)
+        put("/tmp/more.json", json.dumps({"rules": [{"protocol": "udp", "router_ports": str(first), "box_ports": str(first)}
+                                                    for first in range(1, 500)]}))
+        self.expect("rules import /tmp/more.json", OK, "noted")
+        self.expect("save", TOO_MANY, "holds 16384 rules and there are 16499")
+        self.expect("rules discard", OK, "dropped|discarded|in force")
+        self.assertEqual(len(self.rows()), 16000)
 
     def in_force(self):
         """What a daemon reads, whatever edits wait."""

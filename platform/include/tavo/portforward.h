@@ -15,7 +15,10 @@
 extern "C" {
 #endif
 
-enum { TAVO_PF_NAME_SIZE = 1024 };
+enum {
+    TAVO_PF_NAME_SIZE = 1024,
+    TAVO_PF_MAX_SECTIONS = 16384 /* of a file: a node has a kilobyte, and one of nothing but "[]" must not eat it all */
+};
 
 /* One parsed section. Nodes and hashes are made with calloc and TLIBCSzHashAlloc. */
 typedef struct _tag_tavo_pf_conf {

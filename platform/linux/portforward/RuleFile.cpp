@@ -27,7 +27,6 @@ constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr int kMaxPort = 65535;
 constexpr int kLoadTries = 8;
-constexpr size_t kMaxSections = 16384;  // a node has a kilobyte: a file of nothing but "[]" must not eat it all
 
 using tavo::AtBorder;
 using tavo::ConfList;
@@ -188,7 +187,7 @@ ConfList LoadConfList(const char* szPath) {
         return nullptr;
     }
     // A name that was cut could be taken for another one.
-    const bool blFits = rgSections->size() <= kMaxSections &&
+    const bool blFits = rgSections->size() <= TAVO_PF_MAX_SECTIONS &&
                         std::all_of(rgSections->begin(), rgSections->end(),
                                     [](const Section& section) { return section.szName.size() < TAVO_PF_NAME_SIZE; });
     if (!blFits) {
@@ -235,7 +234,12 @@ int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
             TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
             return -1;
         }
-        return tavo::WriteFileAtomic(szPath, tavo::FormatSections(Sections(pHead))) ? 0 : -1;
+        const auto rgSections = Sections(pHead);
+        if (rgSections.size() > TAVO_PF_MAX_SECTIONS) {
+            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
+            return -1;
+        }
+        return tavo::WriteFileAtomic(szPath, tavo::FormatSections(rgSections)) ? 0 : -1;
     });
 }
 
