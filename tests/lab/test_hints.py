@@ -18,12 +18,12 @@ from homelab import BUILD, GATEWAY, LAN2, sh, wait_for
 LAB = OUTSIDE = None
 TOOL = f"{BUILD}/cli/tavoportmap"
 CONF = "/etc/portforward"
-OK, USAGE = 0, 2
+OK, USAGE, AWAY = 0, 2, 6
 # What a hint leaves for the user to fill in; the model is the one that is described in the lab.
 WORDS = {"BRAND": "Alderman", "MODEL": "'Homestead 2'", "VERSION": "1.0", "NAME": "admin", "NUMBER": "32", "PORT": "8443",
          "ID": "1"}
-QUOTED = re.compile(r"(\bthen (?:run )?)?'tavoportmap\s+([^']*)'")
-LINE = re.compile(r"^[ ]+(?:- )?tavoportmap (.+?)(?:  .*)?$", re.M)
+QUOTED = re.compile(r"(\bthen (?:run )?)?'(?:sudo )?tavoportmap\s+([^']*)'")
+LINE = re.compile(r"^[ ]+(?:- )?(?:sudo )?tavoportmap (.+?)(?:  .*)?$", re.M)
 OTHER = re.compile(r"'((?:ip|journalctl|df|systemctl) [^']*)'")
 # Commands that only look: what comes after them stands where it stood before.
 LOOKS = re.compile(r"(?:status|rules list|router show|router table|service plan|test|detect(?!.* --save))\b")
@@ -97,8 +97,8 @@ class Hints(unittest.TestCase):
 
     @staticmethod
     def led(way):
-        """The commands that made the state what it is: those that succeeded at more than looking."""
-        return tuple(step for step, code, _ in way if code == OK and not LOOKS.match(step))
+        """The commands that made the state what it is: those that did more than look, also for a router that is away."""
+        return tuple(step for step, code, _ in way if code in (OK, AWAY) and not LOOKS.match(step))
 
     def walk(self, command, arrange, remedy, path=()):
         code, text = self.do(command, arrange, None, self.led(path))
