@@ -34,7 +34,7 @@ This package has the header, for C and C++, the files for pkg-config and
 CMake, and two examples.")
 set(CPACK_DEBIAN_TOOL_PACKAGE_SECTION net)
 set(CPACK_DEBIAN_TOOL_PACKAGE_DEPENDS "${szLib}, wget, curl")
-set(CPACK_DEBIAN_TOOL_PACKAGE_RECOMMENDS "avahi-daemon, logrotate")
+set(CPACK_DEBIAN_TOOL_PACKAGE_RECOMMENDS "avahi-daemon, logrotate, netbase")
 set(CPACK_DEBIAN_TOOL_PACKAGE_SUGGESTS tavoportcheckd)
 set(CPACK_COMPONENT_TOOL_DESCRIPTION "Finds out what the router is, keeps the port-forwarding rules of this box,
 writes them into the router through UPnP, NAT-PMP or its own pages, keeps

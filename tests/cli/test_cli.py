@@ -391,8 +391,7 @@ class Tool(unittest.TestCase):
         """Rules before, the command, its exit code and words, the rules in force then."""
         web, span = (1, "tcp", "443", "8443", "web"), (1, "all", "5000-5004", "5000-5004", "")
         off = lambda rule: (0, *rule[1:])
-        with open("/etc/services", "a", encoding="utf-8") as services:
-            services.write("zero 0/tcp\nodd 70000/tcp even\nother 7070/tcp even # odd\n")
+        put("/etc/services", "domain 53/tcp\ndomain 53/udp\nzero 0/tcp\nodd 70000/tcp even\nother 7070/tcp even # odd\n")
         for before, command, code, pattern, after in (
                 ((), "open zero", USAGE, "'zero' is neither", ()),
                 ((), "open odd", USAGE, "'odd' is neither", ()),
