@@ -175,16 +175,16 @@ void OfferClose(CLI::App& app, Request& request) {
     CLI::App* pClose = AddCommand(app, "close", "close ports, by number or by the name of a rule");
     pClose->add_option("port", *pWords, "443, 5000-5010, 53/udp, or the name of a rule")->required();
     pClose->footer(
-        "The port goes out of the rules in force; of a range the other ports stay. 'rules disable' and\n"
-        "'save' switch a rule off and keep it.\n");
+        "The port goes out of the rules in force; of a range the other ports stay. 'rules disable' and 'save' switch a "
+        "rule off and keep it.\n");
     pClose->callback(
         [pWords, &request] { request.fnCommand = [pWords, &request] { return ClosePorts(*pWords, request.blJson); }; });
-    AddCommand(app, "off", "close every port of this box on the router, and keep the rules")->callback([&request] {
-        request.fnCommand = [&request] { return Off(request.blJson); };
-    });
-    AddCommand(app, "on", "open again what 'off' has closed")->callback([&request] {
-        request.fnCommand = [&request] { return On(request.blJson); };
-    });
+    CLI::App* pOff = AddCommand(app, "off", "close every port of this box on the router, and keep the rules");
+    pOff->footer("It stays so, whatever a service asks for, until 'tavoportmap on'.\n");
+    pOff->callback([&request] { request.fnCommand = [&request] { return Off(request.blJson); }; });
+    CLI::App* pOn = AddCommand(app, "on", "open again what 'off' has closed");
+    pOn->footer("Opens no rule that was switched off before 'off'; 'tavoportmap rules enable' and 'save' do.\n");
+    pOn->callback([&request] { request.fnCommand = [&request] { return On(request.blJson); }; });
 }
 
 }  // namespace tavo::cli

@@ -157,9 +157,9 @@ void OfferCompat(CLI::App& app, Request& request) {
     pCompat->add_flag("--yes", pWish->blYes, "record the outcome whatever it is, without asking");
     pCompat->add_flag("--stop", pWish->blStop, "end a test that is running and take its mappings away");
     pCompat->footer(
-        "Makes test mappings on the router, counts what it really holds, takes them away, makes\n"
-        "them anew, and looks whether the ports follow. Rules and other devices' mappings stay.\n"
-        "The recorded number of rules is what 'save' goes by from then on. Ctrl-C stops the test.\n");
+        "Makes test mappings on the router, counts what it really holds, takes them away, makes them anew, and looks "
+        "whether the ports follow. Rules and other devices' mappings stay. The recorded number of rules is what 'save' "
+        "goes by from then on. Ctrl-C stops the test.\n");
     pCompat->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return Compat(*pWish, request.blJson); }; });
 }

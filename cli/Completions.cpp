@@ -185,7 +185,7 @@ Reply Completions(const CLI::App& app, const std::string& szShell) {
 }  // namespace
 
 void OfferCompletions(CLI::App& app, Request& request) {
-    CLI::App* pCommand = AddCommand(app, "completions", "Print the completions for a shell: bash, zsh or fish");
+    CLI::App* pCommand = AddCommand(app, "completions", "print the completions for a shell: bash, zsh or fish");
     pCommand->group("");
     const auto pShell = std::make_shared<std::string>();
     pCommand->add_option("shell", *pShell, "bash, zsh or fish")->required()->check(OneOf({"bash", "zsh", "fish"}));

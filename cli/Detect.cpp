@@ -112,9 +112,8 @@ void OfferDetect(CLI::App& app, Request& request) {
         ->check(NumberBetween(0, 65535))
         ->type_name("NUMBER");
     pDetect->footer(
-        "Looks at the interface, the gateway, the way to the Internet and name resolution, then\n"
-        "asks the router itself. It takes some seconds, restarts the avahi service, opens no port\n"
-        "and closes none.\n");
+        "Looks at the interface, the gateway, the way to the Internet and name resolution, then asks the router "
+        "itself. It takes some seconds, restarts the avahi service, opens no port and closes none.\n");
     pDetect->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return RunDetect(*pWish, request.blJson); }; });
 }

@@ -68,17 +68,18 @@ Reply UsedPorts() {
 }
 
 void OfferText(CLI::App& diag, Request& request, const std::string& szName, const std::string& szArgument,
-               const std::string& szWhat, std::function<Reply(const std::string&)> fnAnswer) {
+               const std::string& szExample, const std::string& szWhat,
+               std::function<Reply(const std::string&)> fnAnswer) {
     const auto pText = std::make_shared<std::string>();
     CLI::App* pCommand = AddCommand(diag, szName, szWhat);
-    pCommand->add_option(szArgument, *pText, "its text")->required();
+    pCommand->add_option(szArgument, *pText, "such as " + szExample)->required();
     pCommand->callback(
         [pText, fnAnswer, &request] { request.fnCommand = [pText, fnAnswer] { return fnAnswer(*pText); }; });
 }
 
 void OfferRequest(CLI::App& diag, Request& request, const std::string& szName, const std::string& szWhat,
                   int (*pfnEntry)(const char*)) {
-    OfferText(diag, request, szName, "request", szWhat,
+    OfferText(diag, request, szName, "request", "'hoplink;5000-5001;tcp'", szWhat,
               [pfnEntry](const std::string& szText) { return Caught([&] { return pfnEntry(szText.c_str()); }); });
 }
 
@@ -90,9 +91,8 @@ void OfferDiag(CLI::App& app, Request& request) {
     pDiag->footer(
         "A request is a service's name and pairs of ports and protocol, nine at most:\n"
         "  tavoportmap diag conflicts 'hoplink;5000-5001;tcp;6000;udp'\n");
-    OfferText(*pDiag, request, "parse-ports", "ports", "the single ports of a text such as 80,443,8000-8010",
-              &ParseText);
-    OfferText(*pDiag, request, "to-ports", "numbers", "numbers such as 1,2,3,7, ten at most, as a port list",
+    OfferText(*pDiag, request, "parse-ports", "ports", "80,443,8000-8010", "the single ports of a text", &ParseText);
+    OfferText(*pDiag, request, "to-ports", "numbers", "1,2,3,7", "numbers, ten at most, as a port list",
               &FormatNumbers);
     AddCommand(*pDiag, "rules", "the stored rules with their ports taken apart")->callback([&request] {
         request.fnCommand = [] { return Caught(&TestFuncCreateOpRulesByRuleConf); };

@@ -263,8 +263,8 @@ void OfferOpen(CLI::App& app, Request& request) {
         ->type_name("WORD");
     pOpen->add_flag("--yes", pWish->blYes, "ask nothing, and open also what should not face the world");
     pOpen->footer(
-        "Finds out what the router is when that is not known yet, opens the port there and looks at who\n"
-        "answers. Edits by 'rules' that are not saved stay so. 'tavoportmap close' takes it back.\n"
+        "Finds out what the router is when that is not known yet, opens the port there and looks at who answers. Edits "
+        "by 'rules' that are not saved stay so. 'tavoportmap close' takes it back.\n"
         "Example: tavoportmap open 443 --to 8443 --name web\n");
     pOpen->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return OpenPorts(*pWish, request.blJson); }; });

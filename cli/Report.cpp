@@ -120,10 +120,10 @@ Reply Report() {
 void OfferReport(CLI::App& app, Request& request) {
     CLI::App* pReport = AddCommand(app, "report", "send the files of a failed compatibility test");
     pReport->footer(
-        "Packs what the last 'compat' left, with the brand, model and version of the router, and sends\n"
-        "it to the report server (server in [report] of /etc/tavo/platform.conf). Your settings and\n"
-        "passwords are not in it. It can be made of a router that a database or a test knows to work\n"
-        "with UPnP or NAT-PMP; of another one the files are named.\n");
+        "Packs what the last 'compat' left, with the brand, model and version of the router, and sends it to the "
+        "report server (server in [report] of /etc/tavo/platform.conf). Your settings and passwords are not in it. It "
+        "can be made of a router that a database or a test knows to work with UPnP or NAT-PMP; of another one the "
+        "files are named.\n");
     pReport->callback([&request] { request.fnCommand = &Report; });
 }
 

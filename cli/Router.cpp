@@ -144,7 +144,7 @@ Reply Set(const Wish& wish) {
         return {.enExit = kUsage,
                 .szMessage =
                     "nothing to set; for example\n"
-                    "  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes --max-rules 32\n"
+                    "  tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
                     "  tavoportmap router set --user admin --conn-type http --conn-port 80\n"
                     "'tavoportmap router set --help' explains"};
     }
@@ -199,11 +199,11 @@ void OfferSet(CLI::App& router, Request& request) {
         ->check(NumberBetween(0, 65535))
         ->type_name("NUMBER");
     pSet->footer(
-        "A router that is driven by UPnP or NAT-PMP needs no account and no connection; a router\n"
-        "that has neither needs both, and a description ('tavoportmap routers'). The account is kept\n"
-        "for the day when UPnP or NAT-PMP is switched off again.\n"
+        "A router that is driven by UPnP or NAT-PMP needs no account and no connection; a router that has neither "
+        "needs both, and a description ('tavoportmap routers'). The account is kept for the day when UPnP or NAT-PMP "
+        "is switched off again.\n"
         "Examples:\n"
-        "  tavoportmap router set --brand Acme --model R1 --version 1 --upnp yes --max-rules 32\n"
+        "  tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
         "  tavoportmap router set --user admin --conn-type http --conn-port 80\n");
     pSet->callback([pWish, &request] { request.fnCommand = [pWish] { return Set(*pWish); }; });
 }

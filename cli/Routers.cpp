@@ -111,8 +111,8 @@ void OfferRouters(CLI::App& app, Request& request) {
     pRouters->add_option("search", pWish->rgszWords, "words that must occur in brand, model or version; any case");
     pRouters->add_flag("--update", pWish->blUpdate, "fetch the newest descriptions first");
     pRouters->footer(
-        "These descriptions are for routers that are driven through their own pages. A router with\n"
-        "UPnP or NAT-PMP needs none.\n");
+        "These descriptions are for routers that are driven through their own pages. A router with UPnP or NAT-PMP "
+        "needs none.\n");
     pRouters->callback([pWish, &request] { request.fnCommand = [pWish] { return Routers(*pWish); }; });
 }
 

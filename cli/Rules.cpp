@@ -358,7 +358,7 @@ void OfferFiles(CLI::App& rules, Request& request) {
     pImport->add_flag("--replace", *pReplace, "in place of the rules that are there");
     pImport->add_flag("--force", *pForce, "also when another rule wants the same router port");
     pImport->footer(
-        "A rule is {\"router_ports\": \"443\"} at least; \"box_ports\", \"protocol\" (tcp), \"name\" and \"enabled\"\n"
+        "A rule is {\"router_ports\": \"443\"} at least; \"box_ports\", \"protocol\" (tcp), \"name\" and \"enabled\" "
         "(true) may follow. The rules stand in a list, or in one under \"rules\".\n");
     pImport->callback([=, &request] { request.fnCommand = [=] { return Import(*pPath, *pReplace, *pForce); }; });
     AddCommand(rules, "export", "print the rules as a JSON document, those that are not saved, too")
@@ -371,8 +371,8 @@ void OfferRules(CLI::App& app, Request& request) {
     CLI::App* pRules = AddCommand(app, "rules", "the rules: list, add, remove, enable, disable, edit, import, export");
     pRules->require_subcommand(1);
     pRules->footer(
-        "An edit stands aside until 'tavoportmap save' writes the rules to the router; 'rules discard'\n"
-        "drops it. 'tavoportmap open' and 'close' do it all at once for a port.\n");
+        "An edit stands aside until 'tavoportmap save' writes the rules to the router; 'rules discard' drops it. "
+        "'tavoportmap open' and 'close' do it all at once for a port.\n");
     AddCommand(*pRules, "list", "show the rules, what is not saved yet and which of them want the same port")
         ->callback([&request] { request.fnCommand = &ListRules; });
     OfferAdd(*pRules, request);

@@ -58,9 +58,8 @@ void OfferSave(CLI::App& app, Request& request) {
     CLI::App* pSave = AddCommand(app, "save", "write the rules to the router and wait for its answer");
     pSave->add_flag("--dry-run", *pDry, "only show, port by port, what that would do");
     pSave->footer(
-        "The rules become the router's whole set of ours: what the rules no longer ask for is\n"
-        "taken away, mappings of other devices stay. It can take minutes on a slow router; Ctrl-C\n"
-        "ends the waiting, not the save.\n");
+        "The rules become the router's whole set of ours: what the rules no longer ask for is taken away, mappings of "
+        "other devices stay. It can take minutes on a slow router; Ctrl-C ends the waiting, not the save.\n");
     pSave->callback(
         [pDry, &request] { request.fnCommand = [pDry, &request] { return *pDry ? DryRun() : Save(request.blJson); }; });
 }

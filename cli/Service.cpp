@@ -452,8 +452,8 @@ void OfferService(CLI::App& app, Request& request) {
     CLI::App* pService = AddCommand(app, "service", "the ports of a relay service: set, plan, clear, list, detect");
     pService->require_subcommand(1);
     pService->footer(
-        "A service's request takes the place of its rules. The user's rules win over it, so do other\n"
-        "hosts' mappings on a UPnP router, and a rule of the service that is switched off.\n"
+        "A service's request takes the place of its rules. The user's rules win over it, so do other hosts' mappings "
+        "on a UPnP router, and a rule of the service that is switched off.\n"
         "Example: tavoportmap service set hoplink 5000-5001/tcp 6000/udp --test\n");
     OfferRequest(*pService, request, "set", "have exactly these ports open for a service", true, &Set);
     OfferRequest(*pService, request, "plan", "what that would come to, port by port; changes nothing", true,

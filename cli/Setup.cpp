@@ -302,9 +302,9 @@ void OfferSetup(CLI::App& app, Request& request) {
     CLI::App* pSetup = AddCommand(app, "setup", "find out what the router is, test it and remember it: begin here");
     pSetup->add_flag("--yes", pWish->blYes, "ask nothing: test where that is needed, open no port");
     pSetup->footer(
-        "Looks at the network, asks the router by UPnP and by NAT-PMP, and where nobody knows how far\n"
-        "its model can be relied on tests it, which takes a minute and leaves nothing behind. Shows what\n"
-        "listens on this box and could be opened. It can be run again at any time.\n");
+        "Looks at the network, asks the router by UPnP and by NAT-PMP, and where nobody knows how far its model can be "
+        "relied on tests it, which takes a minute and leaves nothing behind. Shows what listens on this box and could "
+        "be opened. It can be run again at any time.\n");
     pSetup->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return Setup(*pWish, request.blJson); }; });
 }

@@ -122,10 +122,12 @@ void OfferTest(CLI::App& app, Request& request) {
     CLI::App* pTest = AddCommand(app, "test", "test from outside whether the rules' ports can be reached");
     pTest->add_option("id", *pIds, "only these rules, as 'rules list' shows them");
     pTest->footer(
-        "ok: a connection from outside came through to this box. fail: the port is closed, or another\n"
-        "host answers. not tested: nothing listens there on this box, or nobody outside could tell,\n"
-        "which is so for every port as long as no port checker is named as url in [portcheck] of\n"
-        "/etc/tavo/platform.conf; tavoportcheckd on a host elsewhere is one. disabled: switched off.\n");
+        "  ok          a connection from outside came through to this box\n"
+        "  fail        the port is closed, or another host answers\n"
+        "  not tested  nothing listens there on this box, or nobody outside could tell\n"
+        "  disabled    the rule is switched off\n"
+        "Nobody outside can tell as long as no port checker is named as url in [portcheck] of /etc/tavo/platform.conf; "
+        "tavoportcheckd on a host elsewhere is one.\n");
     pTest->callback([pIds, &request] { request.fnCommand = [pIds, &request] { return Test(*pIds, request.blJson); }; });
 }
 
