@@ -1,9 +1,11 @@
-// Asks and reads a line. Relies on iostream. Promises: see Ask.h.
+// Asks and reads a line. Relies on iostream and Table's wrapping. Promises: see Ask.h.
 #include "Ask.h"
 
 #include <unistd.h>
 
 #include <iostream>
+
+#include "Table.h"
 
 namespace tavo::cli {
 
@@ -12,7 +14,10 @@ bool IsAnybodyThere() {
 }
 
 std::string AskLine(const std::string& szQuestion) {
-    std::cerr << szQuestion << std::flush;
+    // What is typed stands behind the blanks at the end, which go when lines are broken.
+    const size_t nEnd = szQuestion.find_last_not_of(' ') + 1;
+    std::cerr << Wrap(std::string_view(szQuestion).substr(0, nEnd), WidthOf(STDERR_FILENO)) << szQuestion.substr(nEnd)
+              << std::flush;
     std::string szAnswer;
     std::getline(std::cin, szAnswer);
     return szAnswer;

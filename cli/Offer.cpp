@@ -98,6 +98,9 @@ Json::Value ToJson(const Listener& listener, const std::string& szRisk) {
 void OpenChosen(const std::string& szChosen, Reply& reply) {
     std::istringstream words(szChosen);
     std::vector<std::string> rgszWords{std::istream_iterator<std::string>(words), {}};
+    if (rgszWords.size() == 1 && (rgszWords[0] == "n" || rgszWords[0] == "no" || rgszWords[0] == "none")) {
+        return;  // as to a question of yes or no, which came before it
+    }
     for (std::string& szWord : rgszWords) {
         while (szWord.ends_with(',')) {
             szWord.pop_back();
