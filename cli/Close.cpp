@@ -60,6 +60,12 @@ std::optional<std::vector<PortPair>> Meant(const Rules& rules, const std::string
     return PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""});
 }
 
+// Whether the daemon has taken away all that is not asked for, although not all that is asked for is open.
+bool IsNothingLeft(const Json::Value& jsAnswer) {
+    const Json::Value& jsPorts = jsAnswer["ports"];
+    return !jsAnswer.isMember("left_over") && !jsPorts.empty() && jsPorts[0].isObject();  // else the library's list
+}
+
 Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
     std::string szWhat = Join(rgszWords);
     size_t nClosed = 0;
@@ -84,6 +90,8 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
         reply.jsAnswer["closed"] = static_cast<Json::UInt>(nClosed);
         if (reply.enExit == kOk) {
             reply.szMessage = fmt::format("{} closed; {}", Clean(szWhat), reply.szMessage);
+        } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
+            reply.szMessage += fmt::format("\n{} itself, which was to be closed, is closed", Clean(szWhat));
         }
     });
 }

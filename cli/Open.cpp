@@ -76,6 +76,16 @@ std::optional<Reply> Dissuade(const Rule& rule, bool blYes, bool blJson) {
     return Reply{.enExit = kUsage, .szMessage = szRisks + "\nNothing was changed; add --yes to open it all the same"};
 }
 
+// Whether the daemon has every port of the rule open, although it could not open all that is asked for.
+bool IsSaidOpen(const Rule& rule, const Json::Value& jsPorts) {
+    const auto rgPairs = PairsOf(rule).value_or(std::vector<PortPair>());
+    return !rgPairs.empty() && std::all_of(rgPairs.begin(), rgPairs.end(), [&](const PortPair& pair) {
+        return std::any_of(jsPorts.begin(), jsPorts.end(), [&](const Json::Value& js) {
+            return js.isObject() && js["name"] == pair.Name() && js["state"] == "open";
+        });
+    });
+}
+
 // The rule among those in force, and into the router.
 Reply SaveOpening(const Rule& rule, bool& blAlready, bool blJson) {
     const Lock lock;
@@ -96,7 +106,10 @@ Reply SaveOpening(const Rule& rule, bool& blAlready, bool blJson) {
     }
     blAlready = opening.blAlready;
     Reply reply = SaveRules(opening.rules, blJson);
-    if (reply.enExit != kOk && AreStored(opening.rules) && !blAlready) {
+    if (reply.enExit == kRefused && IsSaidOpen(rule, reply.jsAnswer["ports"])) {
+        reply.szMessage +=
+            fmt::format("\nPort {} itself, which was asked for, is open on the router", Clean(rule.szRouterPorts));
+    } else if (reply.enExit != kOk && AreStored(opening.rules) && !blAlready) {
         reply.szMessage +=
             fmt::format("\nThe rule stays; 'tavoportmap close {}' takes it back", Clean(rule.szRouterPorts));
     }

@@ -61,6 +61,16 @@ class RealRouter(Case):
             self.assertEqual(self.open_ports(), wanted, f"when '{command}' has ended")
             self.assertEqual(LAB.reaches("tcp", 8443), ("tcp", 8443) in wanted, command)
 
+    def test_the_word_on_this_port_is_not_that_on_another(self):
+        LAB.map_foreign(9999)
+        itself = "itself, which was asked for, is open"
+        for command, pattern in (("open 9999", "(?s)9999/tcp +refused(?!.*" + itself + ").*The rule stays"),
+                                 ("open 8443", "(?s)9999/tcp +refused.*Port 8443 " + itself),
+                                 ("open 9998-9999/tcp", "(?s)9999/tcp +refused(?!.*" + itself + ")"),
+                                 ("close 8443", "(?s)9999/tcp +refused.*8443 itself, which was to be closed, is closed")):
+            self.tool(command, REFUSED, pattern)
+        self.assertEqual(self.open_ports().keys(), {("tcp", 9998)})
+
     def test_nothing_but_a_save_opens_a_port(self):
         self.tool("open 5001")
         self.tool("rules add draft --router-port 5002")
