@@ -2,10 +2,31 @@
 // Promises: see Box.h.
 #include "Box.h"
 
+#include <fcntl.h>
 #include <fmt/format.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cstring>
+
 namespace tavo::cli {
+
+namespace {
+
+constexpr char kLockFile[] = "/tmp/routerconf.lock";
+constexpr char kLockDirectory[] = "/tmp";
+
+// Why the router lock can be held by nobody: an error number; 0 when it can.
+int WhyLockless() {
+    const int fd = open(kLockFile, O_RDWR | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
+    const int nFault = fd < 0 ? errno : 0;
+    if (fd >= 0) {
+        close(fd);
+    }
+    return nFault == ENOENT && access(kLockDirectory, W_OK) == 0 ? 0 : nFault;  // it is made where it is missing
+}
+
+}  // namespace
 
 std::optional<std::string> Gateway() {
     std::string szGateway;
@@ -26,8 +47,16 @@ std::optional<Reply> NeedsRoot() {
 }
 
 Reply Busy() {
-    return NeedsRoot().value_or(Reply{
-        .enExit = kBusy, .szMessage = "another port-forwarding operation is running; try again when it has ended"});
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
+    if (const int nFault = WhyLockless(); nFault != 0) {
+        return {.enExit = kFailed,
+                .szMessage = fmt::format("nothing was begun: {} cannot be opened ({}), and it is what keeps two "
+                                         "operations apart; is /tmp missing or read-only?",
+                                         kLockFile, std::strerror(nFault))};
+    }
+    return {.enExit = kBusy, .szMessage = "another port-forwarding operation is running; try again when it has ended"};
 }
 
 Reply Failure(const std::string& szMessage) {

@@ -71,6 +71,13 @@ class RealRouter(Case):
             self.tool(command, REFUSED, pattern)
         self.assertEqual(self.open_ports().keys(), {("tcp", 9998)})
 
+    def test_a_lock_that_nobody_can_hold_is_no_operation_that_runs(self):
+        self.tool("open 8443")
+        homelab.sh("mount --bind /tmp /tmp && mount -o remount,bind,ro /tmp")
+        self.addCleanup(homelab.sh, "umount -l /tmp")
+        for command in ("open 5001", "close 8443", "rules add web --router-port 80", "detect"):
+            self.tool(command, FAILED, "routerconf.lock cannot be opened .Read-only file system")
+
     def test_nothing_but_a_save_opens_a_port(self):
         self.tool("open 5001")
         self.tool("rules add draft --router-port 5002")
