@@ -75,6 +75,9 @@ Reply RunDetect(const Wish& wish, bool blJson) {
     if (const auto reply = NeedsRoot()) {
         return *reply;
     }
+    if (!wish.blSave && (wish.blTrustUpnp || wish.nMaxRules >= 0)) {
+        return {.enExit = kUsage, .szMessage = "--trust-upnp and --max-rules say what is stored: with --save"};
+    }
     Detected detected{.szGateway = Gateway().value_or("")};
     if (detected.szGateway.empty()) {
         return NoGateway();

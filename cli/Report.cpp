@@ -70,7 +70,7 @@ std::string WhyNotMade() {
     if (!CanBeReported()) {
         return fmt::format(
             "a report is about a router that a database or a test knows to work with UPnP or NAT-PMP, which this one "
-            "is not. The files of its last test are {}",
+            "is not by the last detection ('tavoportmap detect' makes another). The files of its last test are {}",
             fmt::join(kTestFiles, ", "));
     }
     return "its files could not be packed; the system log says why";

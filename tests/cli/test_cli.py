@@ -596,6 +596,7 @@ class Tool(unittest.TestCase):
         self.expect("router set --upnp yes --brand Acme --model R9 --version 2", OK, "stored as the settings")
         self.expect("router show", OK, "driven by +UPnP\n(?s:.)*holds +no limit known")
         self.expect("router set --max-rules 20", OK, "stored as the settings")
+        self.expect("detect --last --max-rules 20", USAGE, "with --save")
         self.expect("router show", OK, "model +R9\n(?s:.)*holds +20 rules\n")
         self.expect("router set --model R1 --version 1 --max-rules 20", FAILED, "says that this router holds 1 rules")
         self.assertEqual(self.json("router", "show")[1]["router"]["max_rules"], 1)
