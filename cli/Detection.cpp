@@ -66,8 +66,8 @@ std::string Pages(const Detected& detected) {
 const char kManualWay[] =
     "Where it has neither, it can be driven through its own pages when its model is described:\n"
     "  tavoportmap routers BRAND    shows the models that are\n"
-    "  tavoportmap router set --brand BRAND --model MODEL --version VERSION --upnp no \\\n"
-    "      --natpmp no --user NAME --conn-type http --conn-port 80";
+    "  tavoportmap router set --brand BRAND --model MODEL --version VERSION \\\n"
+    "      --upnp no --natpmp no --user NAME --conn-type http --conn-port 80";
 
 bool Detected::IsKnown() const {
     const Way enWay = WayOf(result);

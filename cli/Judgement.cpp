@@ -182,7 +182,7 @@ std::string WhyDead(const Daemon& daemon) {
     const std::string szResult =
         daemon.unit->szResult.empty() || daemon.unit->szResult == "success" ? "" : ", " + daemon.unit->szResult;
     return fmt::format(
-        "nothing is kept: {0} does not run (its unit is {1}{2}); 'journalctl -u {0}' says why, 'sudo systemctl "
+        "nothing is kept: {0} does not run (its unit is {1}{2}); 'sudo journalctl -u {0}' says why, 'sudo systemctl "
         "restart {0}' starts it",
         daemon.szName, daemon.unit->szActive, szResult);
 }
@@ -287,9 +287,10 @@ Outcome JudgeRules(const Situation& situation, const std::vector<RuleFact>& rgRu
                                                  Moment(situation.pages->nAt, situation.nNow))
                                    : "";
     if (nWrong > 0) {
-        return {Standing::kPartly, nWanted == 1 ? "the rule is not in force; its row says why" + szAsOf
-                                                : fmt::format("{} of {} rules are not in force; their rows say why{}",
-                                                              nWrong, nWanted, szAsOf)};
+        const char* szRest = nWrong == 1 ? "is not in force; its row says" : "are not in force; their rows say";
+        return {Standing::kPartly, nWanted == 1
+                                       ? "the rule is not in force; its row says why" + szAsOf
+                                       : fmt::format("{} of {} rules {} why{}", nWrong, nWanted, szRest, szAsOf)};
     }
     if (nUnknown > 0) {
         return {Standing::kUntold,

@@ -244,12 +244,11 @@ Reply OpenPorts(const OpenWish& wish, bool blJson) {
         return reply;
     }
     const std::string szProtocol = rule.szProtocol == "all" ? "tcp and udp" : rule.szProtocol;
-    reply.szMessage = fmt::format("port {} ({}) {} open on the router{}", Clean(rule.szRouterPorts), szProtocol,
-                                  blAlready ? "was" : "is",
+    reply.szMessage = fmt::format("port {} ({}) {} on the router{}", Clean(rule.szRouterPorts), szProtocol,
+                                  blAlready ? "was open already" : "is open",
                                   rule.szBoxPorts == rule.szRouterPorts
                                       ? ""
                                       : fmt::format(" and leads to port {} of this box", Clean(rule.szBoxPorts)));
-    reply.szMessage += blAlready ? " already" : "";
     AddListeners(rule, reply);
     AddOutside(rule, blJson, reply);
     return reply;

@@ -71,7 +71,7 @@ const char* Remedy(const Published& published) {
         return "'sudo tavoportmap router set --ask-password' stores another password, and '--user' another name";
     }
     if (published.szProtocol == "pages" && !published.szRouterWhy.empty()) {
-        return "'journalctl -t tavoportforward' says more; 'tavoportmap save' tries again";
+        return "'sudo journalctl -t tavoportforward' says more; 'tavoportmap save' tries again";
     }
     return "Choose other router ports ('tavoportmap rules edit'), or free them there";
 }

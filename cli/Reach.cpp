@@ -18,6 +18,7 @@ constexpr char kAdviceClosed[] =
     "closed from outside: have the rules been written ('tavoportmap save')? Then it is another router on the way "
     "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
 constexpr size_t kUrlSize = 1024;
+constexpr std::string_view kNotTestedSaid = "not tested: ";
 constexpr char kAdviceNoChecker[] =
     "whether a port is open can only be told from outside, by a port checker: tavoportcheckd on a host elsewhere, "
     "named as url in [portcheck] of /etc/tavo/platform.conf";
@@ -49,7 +50,11 @@ std::string LoggedReason(const std::string& szLog, size_t nRule, const PortVerdi
         return "";
     }
     const std::string szReason = szLog.substr(nAt + szBegin.size(), szLog.find('\n', nAt) - nAt - szBegin.size());
-    return Clean(szReason.starts_with(szPort) ? szReason.substr(szPort.size()) : szReason);
+    std::string_view szRest(szReason);
+    for (const std::string_view szSaid : {std::string_view(szPort), kNotTestedSaid}) {  // beside it in the table
+        szRest.remove_prefix(szRest.starts_with(szSaid) ? szSaid.size() : 0);
+    }
+    return Clean(std::string(szRest));
 }
 
 // What stands there when the tester said nothing.

@@ -77,7 +77,7 @@ Reply ChangeRules(const std::function<Reply(Rules&)>& fnChange) {
     Reply reply = fnChange(*rules);
     if (reply.enExit == kOk && !StoreDraft(*rules)) {
         return Failure(
-            fmt::format("the edit could not be written to {}; nothing was changed{}", kDirectory,
+            fmt::format("the edit could not be written to {}{}; nothing was changed", kDirectory,
                         access(kDirectory, W_OK) == 0 ? " (is the disk full?)" : ", which is missing or read-only"));
     }
     WarnOfOverlaps(*rules, reply);

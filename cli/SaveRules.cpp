@@ -68,13 +68,13 @@ Reply WhyFailed(const StoredRouter& router, const Rules& rules, const SaveResult
     if (router.enWay == Way::kManual) {
         return Failure(
             "the rules are stored, but the program that writes them into the router's pages failed or did "
-            "not end; the system log has the reason:\n  journalctl -t tavoportforward");
+            "not end; the system log has the reason:\n  sudo journalctl -t tavoportforward");
     }
     const char* szDaemon = router.enWay == Way::kNatpmp ? "natpmpd" : "upnpd";
     const bool blAlive = router.enWay == Way::kNatpmp ? NatpmpDaemon().IsAlive() : UpnpDaemon().IsAlive();
     Reply reply =
-        Failure(fmt::format("the rules are stored, but {} {}; the system log says why:\n  journalctl -t {}", szDaemon,
-                            blAlive ? "has not answered in five minutes" : "could not be started", szDaemon));
+        Failure(fmt::format("the rules are stored, but {} {}; the system log says why:\n  sudo journalctl -t {}",
+                            szDaemon, blAlive ? "has not answered in five minutes" : "could not be started", szDaemon));
     reply.enExit = kAway;
     return reply;
 }

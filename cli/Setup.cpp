@@ -148,7 +148,7 @@ Reply Finder::ByTest() {
         const DetectResult& result = mDetected.result;
         if (!Confirm(
                 fmt::format("{} ({}).\nA test makes some {} mappings on ports that nobody uses and takes them away "
-                            "again; rules and other devices'\nmappings stay as they are. It takes a minute, on slow "
+                            "again; rules and other devices' mappings stay as they are. It takes a minute, on slow "
                             "routers some more. Test it now?",
                             FindingWords(Finding::kUntested, mDetected),
                             RouterName(result.szBrand, result.szModel, result.szVersion), kUsualTestRules))) {
@@ -251,8 +251,9 @@ std::string Finder::ForceHint() const {
 Reply Finder::Nothing() {
     const Finding enFinding = FindingOf(mDetected);
     std::string szMessage = FindingWords(enFinding, mDetected);
-    if (mBefore.enFound == Found::kYes) {
-        szMessage += "; what is stored of it stays as it is";
+    const char* szStored = mBefore.enFound == Found::kYes ? "; what is stored of it stays as it is" : "";
+    if (enFinding == Finding::kNoRouter || enFinding == Finding::kDistrusted || enFinding == Finding::kNameless) {
+        szMessage += szStored;
     }
     switch (enFinding) {
         case Finding::kNoRouter:
@@ -267,7 +268,7 @@ Reply Finder::Nothing() {
             szMessage += kManualWay;
             break;
         default:
-            szMessage += std::string(", then run 'tavoportmap setup' again. ") + kManualWay;
+            szMessage += fmt::format(", then run 'tavoportmap setup' again{}. {}", szStored, kManualWay);
     }
     return {.enExit = kFailed, .szMessage = szMessage};
 }

@@ -87,7 +87,8 @@ std::string RuleWords(const Situation& situation) {
 
 std::string LiveWords(const Situation& situation) {
     if (situation.live) {
-        return fmt::format("{} entries in its table{}", situation.live->rgEntries.size(),
+        const size_t nEntries = situation.live->rgEntries.size();
+        return fmt::format("{} {} in its table{}", nEntries, nEntries == 1 ? "entry" : "entries",
                            situation.live->blWhole ? "" : ", which it did not show to the end");
     }
     return situation.blAsked ? "does not answer by UPnP" : "";

@@ -11,7 +11,7 @@ enum SaveStatus : int { kTooManyRules = 7, kTooManyPorts = 10, kNoRangePage = 11
 
 constexpr char kFindOut[] =
     "\n  tavoportmap setup                          asks the router, tests it and remembers the answer"
-    "\n  tavoportmap router set --brand BRAND --model MODEL --version VERSION --upnp yes"
+    "\n  tavoportmap router set --brand BRAND --model MODEL --upnp yes"
     "\n                                             says it yourself, when it cannot be found out";
 
 // Which limit of the pages is in the way, as the library reports it: by the limits alone.

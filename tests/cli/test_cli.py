@@ -397,7 +397,7 @@ class Tool(unittest.TestCase):
                 ((), "open odd", USAGE, "'odd' is neither", ()),
                 ((), "open even", OK, "port 7070 .tcp.", ((1, "tcp", "7070", "7070", "even"),)),
                 ((), "open 443 --to 8443 --name web", OK, "port 443 .tcp. is open(?s:.)*leads to port 8443", (web,)),
-                ((web,), "open https --to 8443", OK, "was open on the router(?s:.)*already", (web,)),
+                ((web,), "open https --to 8443", OK, "was open already on the router and leads", (web,)),
                 ((off(web),), "open 443 --to 8443", OK, "is open", (web,)),
                 ((web,), "open 443", USAGE, r"leads to port 8443 of this box already, by rule 7 \(web\); .*close 443/tcp", (web,)),
                 ((web,), "open web --to 80,8443", OK, "port 80,443 .tcp. is open", (web, (1, "tcp", "80", "80", "web"))),

@@ -24,7 +24,7 @@ WORDS = {"BRAND": "Alderman", "MODEL": "'Homestead 2'", "VERSION": "1.0", "NAME"
          "ID": "1"}
 QUOTED = re.compile(r"(\bthen (?:run )?)?'(?:sudo )?tavoportmap\s+([^']*)'")
 LINE = re.compile(r"^[ ]+(?:- )?(?:sudo )?tavoportmap (.+?)(?:  .*)?$", re.M)
-OTHER = re.compile(r"'((?:ip|journalctl|df|systemctl) [^']*)'")
+OTHER = re.compile(r"'(?:sudo )?((?:ip|journalctl|df|systemctl) [^']*)'")
 # Commands that only look: what comes after them stands where it stood before.
 LOOKS = re.compile(r"(?:status|rules list|router show|router table|service plan|test|detect(?!.* --save))\b")
 

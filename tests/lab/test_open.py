@@ -49,7 +49,7 @@ class RealRouter(Case):
         for command, pattern, wanted in (
                 ("open 8443 --to 5001 --name web", "port 8443 .tcp. is open on the router and leads to port 5001 of this box",
                  {("tcp", 8443): 5001}),
-                ("open 8443 --to 5001", "was open on the router", {("tcp", 8443): 5001}),
+                ("open 8443 --to 5001", "was open already on the router and leads to port 5001", {("tcp", 8443): 5001}),
                 ("open 6000-6001/udp --to 5001-5002", r"port 6000-6001 .udp. is open",
                  {("tcp", 8443): 5001, ("udp", 6000): 5001, ("udp", 6001): 5002}),
                 ("close 6000", "6000 closed; 2 rules in force", {("tcp", 8443): 5001, ("udp", 6001): 5002}),
