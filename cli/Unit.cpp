@@ -3,7 +3,9 @@
 #include "Unit.h"
 
 #include <fmt/format.h>
+#include <linux/magic.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/sysmacros.h>
 
 #include <cstdio>
@@ -26,12 +28,21 @@ constexpr size_t kMostOutput = 4096;
 constexpr char kRouterLock[] = "/tmp/routerconf.lock";
 constexpr const char* kDetectorLocks[] = {"/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock"};
 
+// Whether /proc/locks may name this file by another device than stat does: a file system that spans devices has a
+// number for itself and others for its files. A tmpfs has but one; where /tmp and /run are such, the small numbers of
+// their files are often the same, and the device alone tells them apart.
+bool HasOtherDevice(const char* szPath, const struct stat& info) {
+    struct statfs about = {};
+    return major(info.st_dev) == 0 && statfs(szPath, &about) == 0 && about.f_type != TMPFS_MAGIC;
+}
+
 // Who holds a lock on this file; nothing when nobody does, 0 for a process that cannot be seen from here.
 std::optional<pid_t> HolderOf(const char* szPath) {
     struct stat info = {};
     if (lstat(szPath, &info) != 0 || !S_ISREG(info.st_mode)) {
         return std::nullopt;
     }
+    const bool blOtherDevice = HasOtherDevice(szPath, info);
     std::ifstream stream("/proc/locks");
     for (std::string szLine; std::getline(stream, szLine);) {
         // "7: FLOCK  ADVISORY  WRITE 812 00:2d:1304 0 EOF"; who waits for a lock has "->" in front of the kind.
@@ -44,8 +55,7 @@ std::optional<pid_t> HolderOf(const char* szPath) {
             std::string_view(szKind) != "FLOCK" || nInode != info.st_ino) {
             continue;
         }
-        // A file system that spans devices has a number for itself and others for its files.
-        if (major(info.st_dev) == 0 || (major(info.st_dev) == nMajor && minor(info.st_dev) == nMinor)) {
+        if (blOtherDevice ? nMajor == 0 : major(info.st_dev) == nMajor && minor(info.st_dev) == nMinor) {
             return std::max(nPid, 0);
         }
     }

@@ -966,6 +966,15 @@ class Tool(unittest.TestCase):
             with open(path, "w", encoding="utf-8") as lock:
                 fcntl.flock(lock, fcntl.LOCK_EX)
                 self.expect("status", AWAY, "running now +a detection(?s:.)*nothing is kept while a detection of the router goes on")
+            other = "/run/other.lock"  # a lock of somebody else, on a file of the same number elsewhere
+            put(other, "")
+            while (ours := os.stat(path).st_ino) != (theirs := os.stat(other).st_ino):
+                behind = path if ours < theirs else other
+                os.unlink(behind)
+                put(behind, "")
+            with open(other, encoding="utf-8") as lock:
+                fcntl.flock(lock, fcntl.LOCK_EX)
+                self.assertEqual(self.json("status")[1]["running"], "idle", path)
         self.assertEqual(self.json("status")[1]["running"], "idle")
 
     # ---- relay services -------------------------------------------------------------------------
