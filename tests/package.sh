@@ -45,6 +45,11 @@ done
     [ -d "$szFile" ] || dpkg-query -W -f '${Conffiles}' tavoportmap | grep -q " $szFile " || echo "$szFile"
 done)" ] || fail "a file in /etc is no conffile"
 [ "$(stat -c %a /tmp/upnp_test.lock)" = 600 ] || fail "the lock files are not there"
+find /usr/share/doc/tavoportmap -name '*.md' | while read -r szFile; do
+    grep -oE '\]\([^):#]+' "$szFile" | sed 's/^](//' | while read -r szLink; do
+        [ -e "$(dirname "$szFile")/$szLink" ] || fail "$szFile links to $szLink"
+    done
+done
 tavoportmap status | grep -q '^gateway' || fail "the installed tool does not run"
 tavoportmap rules add web --router-port 443 >/dev/null
 completed() { # WORDS... : what bash offers for the last one
