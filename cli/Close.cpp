@@ -133,9 +133,8 @@ Reply Off(bool blJson) {
     return reply;
 }
 
-// Switches on what was on before. How many rules.
-size_t SwitchOn(Rules& rules, const Rules& before) {
-    size_t nOn = 0;
+// Switches on what was on before.
+void SwitchOn(Rules& rules, const Rules& before) {
     for (Rule rule : before) {
         rule.blEnabled = false;
         const auto pRule = std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
@@ -147,10 +146,8 @@ size_t SwitchOn(Rules& rules, const Rules& before) {
             });
         if (pSame != rules.end()) {
             pSame->blEnabled = true;
-            ++nOn;
         }
     }
-    return nOn;
 }
 
 Reply On(bool blJson) {
@@ -163,12 +160,10 @@ Reply On(bool blJson) {
                 "shows the rules, 'tavoportmap rules enable RULE' and 'tavoportmap save' open one again");
         }
         if (enState == ReadState::kAbsent) {
-            return Reply{.szMessage = "nothing to switch on: nothing was switched off by 'tavoportmap off'"};
-        }
-        if (SwitchOn(rules, before) == 0) {
             DropOff();
-            return Reply{.szMessage = "nothing to switch on: the rules that were switched off are gone"};
+            return Reply{.szMessage = "nothing to switch on: no rule in force is one that 'tavoportmap off' closed"};
         }
+        SwitchOn(rules, before);
         return std::nullopt;
     };
     Reply reply = Change(blJson, fnChange, [](Reply&) { DropOff(); });

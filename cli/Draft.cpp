@@ -215,9 +215,12 @@ private:
     int mNLast = 0;
 };
 
-bool IsEveryRuleOff() {
-    const auto inForce = LoadRules();
-    return inForce && std::none_of(inForce->begin(), inForce->end(), [](const Rule& rule) { return rule.blEnabled; });
+// The rules in force when none of them is on.
+std::optional<Rules> LoadIfEachIsOff() {
+    auto inForce = LoadRules();
+    const bool blAnyOn =
+        inForce && std::any_of(inForce->begin(), inForce->end(), [](const Rule& r) { return r.blEnabled; });
+    return blAnyOn ? std::nullopt : inForce;
 }
 
 }  // namespace
@@ -312,12 +315,22 @@ Reply Unreadable() {
 
 // ---- off ---------------------------------------------------------------------------------------------------
 
+// The note of an 'off' or 'on' that was killed stays, and says nothing once the rules that it names are gone.
 ReadState ReadOff(Rules& rules) {
+    const auto inForce = LoadIfEachIsOff();
     std::string szText;
-    const ReadState enState = IsEveryRuleOff() ? ReadOwnFile(kOff, szText) : ReadState::kAbsent;
+    const ReadState enState = inForce ? ReadOwnFile(kOff, szText) : ReadState::kAbsent;
     const auto noted = enState == ReadState::kRead ? FromFile(ObjectOf(szText)["rules"]) : std::nullopt;
-    rules = noted.value_or(Rules());
-    return enState == ReadState::kRead && !noted ? ReadState::kUnreadable : enState;
+    if (!noted) {
+        return enState == ReadState::kAbsent ? enState : ReadState::kUnreadable;
+    }
+    const bool blHolds = std::any_of(noted->begin(), noted->end(), [&](Rule rule) {
+        rule.blEnabled = false;
+        return std::any_of(inForce->begin(), inForce->end(),
+                           [&](const Rule& there) { return IsSameContent(there, rule); });
+    });
+    rules = blHolds ? *noted : Rules();
+    return blHolds ? ReadState::kRead : ReadState::kAbsent;
 }
 
 bool StoreOff(const Rules& rules) {

@@ -49,7 +49,8 @@ bool IsSameContent(const Rule& one, const Rule& other);
 // For each rule of one its fellow in other by id, and by content where an id stands twice; npos where there is none.
 std::vector<size_t> Fellows(const Rules& one, const Rules& other);
 
-// The rules that 'off' switched off; absent when it did not, or when somebody has opened ports since.
+// The rules that 'off' switched off; absent when it did not, or when somebody has opened ports or taken all of those
+// rules away since.
 ReadState ReadOff(Rules& rules);
 inline std::optional<Rules> LoadOff() {
     Rules rules;

@@ -458,6 +458,12 @@ class Tool(unittest.TestCase):
                          [("web", True), ("never", False), ("dns", True)])
         self.assertFalse(os.path.exists(OFF))
         self.assertEqual(len(self.rows()), 4)
+        put(OFF, noted)  # of an 'off' or 'on' that was killed
+        self.expect("close web dns", OK, "closed", **WRITES)
+        self.assertFalse(self.json("rules", "list")[1]["off"])
+        self.expect("on", OK, "nothing to switch on", **WRITES)
+        put(OFF, noted)
+        self.expect("open 92", OK, "port 92 .tcp. is open", **WRITES)
 
     # ---- saving ---------------------------------------------------------------------------------
 
