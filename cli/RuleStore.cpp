@@ -20,14 +20,29 @@ namespace {
 constexpr int kPorts = 65536;
 constexpr int kMaxNumber = 1'000'000'000;  // ids beyond it are not ours, and need no successor
 
+constexpr char kBlanks[] = " \t\r";  // as the daemons have it
+
+// A protocol as the daemons read it, in the one way that it is written here; what is none stays as it is.
+std::string ProtocolOf(const std::string& szText) {
+    const std::string szWord = CLI::detail::to_lower(CLI::detail::trim_copy(szText, kBlanks));
+    if (szWord == "both" || szWord == "tcp_udp") {
+        return "all";
+    }
+    return szWord == "tcp" || szWord == "udp" || szWord == "all" ? szWord : szText;
+}
+
 bool ReadRule(RouterRuleConfReader& reader, Rule& rule) {
     reader.GetRuleServiceName(rule.szName);
-    return reader.GetRuleID(rule.szId) != 0 && reader.GetRuleInfo(rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts,
-                                                                  rule.szProtocol, rule.szServiceId) != 0;
+    const bool blRead =
+        reader.GetRuleID(rule.szId) != 0 &&
+        reader.GetRuleInfo(rule.blEnabled, rule.szRouterPorts, rule.szBoxPorts, rule.szProtocol, rule.szServiceId) != 0;
+    rule.szProtocol = ProtocolOf(rule.szProtocol);
+    return blRead;
 }
 
 std::optional<int> ParsePort(const std::string& szPadded) {
-    const std::string szText = CLI::detail::trim_copy(szPadded);  // the library writes lists as "80, 443"
+    // The library writes lists as "80, 443"; a line end is no blank to the daemons.
+    const std::string szText = CLI::detail::trim_copy(szPadded, kBlanks);
     int nPort = 0;
     const char* pEnd = szText.data() + szText.size();
     const auto [pRead, error] = std::from_chars(szText.data(), pEnd, nPort);

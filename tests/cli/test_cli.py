@@ -169,6 +169,8 @@ class Tool(unittest.TestCase):
                                      ("450", USAGE, "rule 4 forwards more than '450'(?s:.)*tavoportmap close 450"),
                                      ("http", USAGE, "there is no rule http")):
             self.expect(f"rules remove {which}", code, pattern)
+        for ports in ("80\n", "80,\v81"):  # no daemon takes it
+            self.assertEqual(tool("rules", "add", "--router-port", ports)[0], USAGE)
         self.assertEqual(self.rows(), [("1", True, "tcp", "443", "8443", "web"),
                                        ("2", True, "all", "53,5000-5001", "53,5000-5001", "dns"),
                                        ("4", False, "tcp", "400-500", "400-500", "")])
@@ -407,6 +409,9 @@ class Tool(unittest.TestCase):
                 ((), "open ssh", USAGE, "guessed passwords(?s:.)*add --yes", ()),
                 ((), "open 4445 --to 445", USAGE, "file sharing(?s:.)*add --yes", ()),
                 ((), "open 443 --to 80,81", USAGE, "1 router ports but 2 box ports", ()),
+                (((1, "TCP", "443", "8443", "web"), (1, "Tcp_Udp", "53", "53", "")), "close 443 53/udp", OK, "closed; 1 rule",
+                 ((1, "tcp", "53", "53", ""),)),
+                (((1, "both", "443", "443", ""),), "open 443", OK, "was open", ((1, "all", "443", "443", ""),)),
                 ((web, span), "close 443", OK, "443 closed; 1 rule in force", (span,)),
                 ((web, span), "close web", OK, "web closed", (span,)),
                 ((span,), "close 5002/udp", OK, "closed", ((1, "tcp", "5000-5004", "5000-5004", ""),
