@@ -278,6 +278,11 @@ Reply SaveRules(const Rules& rules, bool blJson) {
     const StoredRouter router = ReadStoredRouter();
     const auto refused = Refused(router, *szGateway, rules, result);
     Reply reply = refused ? *refused : SaveRecords(router, *szGateway, rules, *rgRecords, result, blJson);
+    if (reply.enExit == kOk && !AreStored(rules)) {
+        reply.rgszWarnings.emplace_back(
+            "somebody else has changed /etc/portforward/rule.conf meanwhile: the next save goes by what stands there now "
+            "('tavoportmap rules list')");
+    }
     reply.jsAnswer["status"] = result.nStatus;
     reply.jsAnswer["rules"] = static_cast<Json::UInt>(rules.size());
     return reply;

@@ -432,6 +432,13 @@ class Tool(unittest.TestCase):
             self.assertEqual([key(rule) for rule in self.in_force()], list(after), command)
             self.assertEqual([row[3] for row in self.rows() if row[5] == "unsaved"], ["7777"], "the edit still waits")
 
+    def test_a_rule_file_that_is_another_one_after_the_save_is_pointed_out(self):
+        put(ROUTER, KNOWN % ("yes", "no"))
+        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        self.store((1, "tcp", "443", "8443", "web"))
+        for command in ("open 80", "close 443", "off"):
+            self.expect(command, OK, "warning: somebody else has changed", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
+
     def test_an_address_that_nobody_outside_reaches_is_no_address_to_try(self):
         pid = self.keep()
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
