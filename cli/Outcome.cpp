@@ -4,7 +4,9 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <set>
 
+#include "PortPairs.h"
 #include "Table.h"
 
 namespace tavo::cli {
@@ -60,6 +62,28 @@ std::string StateWords(const PublishedRule& rule) {
     }
 }
 
+// Whether it speaks of just these rules: what was published a moment before a save has the same second. What is no
+// single port cannot be compared.
+bool IsAbout(const Published& published, const Rules& rules) {
+    std::set<std::string> setAsked, setSaid;
+    for (const Rule& rule : rules) {
+        const auto rgPairs = rule.blEnabled ? PairsOf(rule) : std::vector<PortPair>();
+        if (!rgPairs) {
+            return true;
+        }
+        for (const PortPair& pair : *rgPairs) {
+            setAsked.insert(pair.Name());
+        }
+    }
+    for (const PublishedRule& said : published.rgRules) {
+        if (said.nRouterPort == 0) {
+            return true;
+        }
+        setSaid.insert(PortPair{said.szProtocol, said.nRouterPort, said.nBoxPort}.Name());
+    }
+    return setAsked == setSaid;
+}
+
 size_t NotOpen(const Published& published) {
     return static_cast<size_t>(std::count_if(published.rgRules.begin(), published.rgRules.end(),
                                              [](const PublishedRule& r) { return r.enState != PortState::kOpen; }));
@@ -78,9 +102,23 @@ const char* Remedy(const Published& published) {
 
 }  // namespace
 
-std::optional<Published> PublishedSince(const StoredRouter& router, time_t nSince) {
+std::optional<Published> PublishedSince(const StoredRouter& router, const Rules& rules, time_t nSince) {
     auto published = ReadPublished(ProgramOf(router));
-    return published && published->nAt >= nSince ? published : std::nullopt;
+    const bool blNew = published && published->nAt >= nSince;
+    return blNew && (router.enWay == Way::kManual || IsAbout(*published, rules)) ? published : std::nullopt;
+}
+
+std::optional<Reply> Unsaid(const StoredRouter& router) {
+    const bool blAlive = router.enWay == Way::kNatpmp ? NatpmpDaemon().IsAlive()
+                         : router.enWay == Way::kUpnp ? UpnpDaemon().IsAlive()
+                                                      : false;
+    if (!blAlive) {
+        return std::nullopt;
+    }
+    return Failure(fmt::format(
+        "the rules are stored, but {} has not said what became of them, so that nothing is known to be open or closed "
+        "on the router; is the disk full ('df /run')? 'tavoportmap status --live' looks again",
+        ProgramOf(router)));
 }
 
 void AddPorts(const Published& published, bool blAll, Reply& reply) {

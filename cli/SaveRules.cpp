@@ -27,6 +27,9 @@ constexpr int kRulesWritten = 80;  // percent, once the rule file is written
 constexpr auto kPoll = std::chrono::milliseconds(50);
 constexpr auto kHandOver = std::chrono::seconds(5);
 constexpr auto kTakenAway = std::chrono::seconds(60);
+constexpr char kChanged[] =
+    "somebody else has changed /etc/portforward/rule.conf meanwhile: the next save goes by what stands there now "
+    "('tavoportmap rules list')";
 
 std::string StepAt(int nPercent) {
     switch (nPercent) {
@@ -84,7 +87,7 @@ std::string WhyRefused(const SaveResult& result, Way enWay) {
     const std::string szPorts = Clean(result.szPortList);
     if (result.nStatus == 9) {
         return fmt::format(
-            "the router refused these ports: {}\nThe other rules are in force. The reasons stand in "
+            "these ports are not open on the router: {}\nThe others, if any, are. The reasons stand in "
             "/var/tmp/upnp_portmap.status",
             szPorts);
     }
@@ -235,7 +238,11 @@ Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, cons
     if (nResult != 0 && result.nStatus == 0) {
         return WhyFailed(router, rules, result);
     }
-    const auto published = PublishedSince(router, nStart);
+    const auto published = PublishedSince(router, rules, nStart);
+    const auto unsaid = nResult == 0 && !published ? Unsaid(router) : std::nullopt;
+    if (unsaid) {
+        return AreStored(rules) ? *unsaid : Failure(kChanged);
+    }
     Reply reply = nResult == 0 ? Saved(szGateway, router, rules) : Explain(result, router, rules.size());
     if (published && (nResult == 0 || reply.enExit == kRefused)) {
         const Exit enLibrary = reply.enExit;
@@ -279,9 +286,7 @@ Reply SaveRules(const Rules& rules, bool blJson) {
     const auto refused = Refused(router, *szGateway, rules, result);
     Reply reply = refused ? *refused : SaveRecords(router, *szGateway, rules, *rgRecords, result, blJson);
     if (reply.enExit == kOk && !AreStored(rules)) {
-        reply.rgszWarnings.emplace_back(
-            "somebody else has changed /etc/portforward/rule.conf meanwhile: the next save goes by what stands there now "
-            "('tavoportmap rules list')");
+        reply.rgszWarnings.emplace_back(kChanged);
     }
     reply.jsAnswer["status"] = result.nStatus;
     reply.jsAnswer["rules"] = static_cast<Json::UInt>(rules.size());

@@ -237,7 +237,7 @@ Reply NotSet(const Surroundings& found, const std::string& szLog, time_t nStart)
             "the "
             "system log says why");
     }
-    const auto published = PublishedSince(ReadStoredRouter(), nStart);
+    const auto published = PublishedSince(ReadStoredRouter(), found.plan.after, nStart);
     Reply reply = published ? OutcomeOf(*published, found.plan.after, published->szGateway)
                             : Failure(
                                   "the rules are stored, but the router did not take them all, or its daemon did not "
@@ -259,7 +259,8 @@ void AddTested(const Wish& wish, const Requests& rgRequests, const std::string& 
 Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& szLog, time_t nStart) {
     Reply reply;
     AwaitDaemon();  // the library does not, for rules that leave none
-    const auto published = PublishedSince(ReadStoredRouter(), nStart);
+    const StoredRouter router = ReadStoredRouter();
+    const auto published = PublishedSince(router, found.plan.after, nStart);
     const bool blAll = Describe(found.plan, reply);
     if (wish.blTest && !found.rgRequests.empty()) {
         AddTested(wish, found.rgRequests, szLog, reply);
@@ -271,7 +272,8 @@ Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& sz
             "shows what came of it";
         return reply;
     }
-    if (const Reply outcome = published ? OutcomeOf(*published, found.plan.after, published->szGateway) : Reply();
+    if (const Reply outcome = published ? OutcomeOf(*published, found.plan.after, published->szGateway)
+                                        : Unsaid(router).value_or(Reply());
         outcome.enExit != kOk) {
         return outcome;
     }

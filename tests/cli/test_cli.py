@@ -439,13 +439,22 @@ class Tool(unittest.TestCase):
         for command in ("open 80", "close 443", "off"):
             self.expect(command, OK, "warning: somebody else has changed", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
 
+    def test_without_a_word_on_these_rules_nothing_is_called_done(self):
+        for command in ("open 80", "close 443", "off"):
+            for said in (False, True):  # nothing at all, or of the rules before in the same second
+                pid = self.keep()
+                put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+                if said:
+                    self.publish(pid, at=int(time.time()) + 60)
+                self.expect(command, FAILED, "upnpd has not said what became of them(?s:.)*df /run", **WRITES)
+
     def test_an_address_that_nobody_outside_reaches_is_no_address_to_try(self):
         pid = self.keep()
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
         for outside, kind, pattern in (("198.41.0.4", "public", "from outside it is https://198.41.0.4/(?!(?s:.)*nobody on the Internet)"),
                                        ("192.168.0.9", "private", "warning: .*another router stands(?s:.)*nobody on the Internet"),
                                        ("100.64.0.9", "carrier", "warning: .*the provider's own(?s:.)*nobody on the Internet")):
-            self.publish(pid, outside=outside)
+            self.publish(pid, outside=outside, at=int(time.time()) + 60)
             self.expect("open 443 --to 8443", OK, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0 write")
             self.assertEqual(self.json("open", "443", "--to", "8443", **WRITES)[1]["outside_kind"], kind)
 
@@ -488,7 +497,7 @@ class Tool(unittest.TestCase):
                 ("-1 7 5", TOO_MANY, "holds 5 rules and there are 1\nNothing was changed"),
                 ("-1 8 5000/tcp, 53/udp", REFUSED, "already holds these ports.*: 5000/tcp, 53/udp\nThe other rules are in force"),
                 ("-1 8 \x1b[31m", REFUSED, r"router: \\x1b\[31m"),
-                ("-1 9 80/tcp", REFUSED, "refused these ports: 80/tcp(?s:.)*upnp_portmap.status"),
+                ("-1 9 80/tcp", REFUSED, "not open on the router: 80/tcp(?s:.)*upnp_portmap.status"),
                 ("-1 10 -1", TOO_MANY, "do not fit this router"),
                 ("-1 10 4", TOO_MANY, "4 single ports and no ranges"),
                 ("-1 10 0", TOO_MANY, "holds no single ports and no ranges"),
