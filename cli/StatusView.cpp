@@ -234,7 +234,10 @@ std::string ToText(const Situation& situation, const Judgement& judgement, bool 
         {"gateway", situation.szGateway.value_or("none")},
         {"this box", situation.szBox},
         {"settings", SettingsWords(situation)},
-        {"last detection", situation.detected ? OneLine(*situation.detected) : "none, or without a result"},
+        // Of a known router it is not what counts: a test may have found out since what no detection knew.
+        {"last detection", situation.settings.blAny ? ""
+                           : situation.detected     ? OneLine(*situation.detected)
+                                                    : "none, or without a result"},
         {"outside address", OutsideWords(situation)},
         {"translations", TranslationWords(situation)},
         {"IPv6", situation.szIpv6.empty() ? "" : situation.szIpv6 + "; the rules are for IPv4 only"},
