@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "daemons/common/Reconcile.h"
+#include "mapping/Carry.h"
 #include "daemons/common/Wanted.h"
 #include "tavo/net.h"
 #include "upnp/Igd.h"
@@ -103,7 +103,9 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
     }
     tavo::LeaseHabit habit;
     BenchRouter router(igd);
-    const tavo::PassResult result = tavo::Reconcile(router, rgWanted, szBox, habit, false, [] { return false; });
+    tavo::Record record("", "bench");
+    const tavo::PassResult result =
+        tavo::BringInLine(router, rgWanted, record, habit, {szBox, tavo::BootSeconds, [] { return false; }, [] {}});
     int nMissing = 0;
     for (const tavo::Outcome& outcome : result.rgOutcomes) {
         if (outcome.verdict.szWord != "1") {

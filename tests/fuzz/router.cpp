@@ -13,7 +13,7 @@
 #include <string_view>
 #include <tuple>
 
-#include "daemons/common/Reconcile.h"
+#include "mapping/Carry.h"
 #include "daemons/common/Wanted.h"
 #include "upnp/Igd.h"
 #include "upnp/Ssdp.h"
@@ -164,7 +164,9 @@ void Map(tavo::Igd& igd) {
     }
     Watched router(igd);
     tavo::LeaseHabit habit;
-    const tavo::PassResult result = tavo::Reconcile(router, rgWanted, kBox, habit, true, [] { return false; });
+    tavo::Record record("", "boot");
+    const tavo::PassResult result =
+        tavo::BringInLine(router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] {}});
     Require(result.rgOutcomes.size() >= rgWanted.size(), "every mapping has a status");
     for (size_t i = 0; i < result.rgOutcomes.size(); ++i) {
         const std::string& szStatus = result.rgOutcomes[i].verdict.szWord;

@@ -177,7 +177,7 @@ class Lab:
     def clear_state(*more):
         """What a save and the daemons leave behind."""
         for path in ("/etc/portforward/rule.conf", "/tmp/pfProgress", "/var/lib/tavo/upnp_igd.conf",
-                     "/var/lib/tavo/natpmp_held.conf", *more):
+                     "/var/lib/tavo/upnp_made.conf", "/var/lib/tavo/natpmp_held.conf", *more):
             if os.path.exists(path):
                 os.unlink(path)
 
@@ -248,10 +248,10 @@ class Lab:
 
     # ---- the real router ----------------------------------------------------------------------------
 
-    def start_router(self, version1=False, port=5000, upnp=True):
+    def start_router(self, version1=False, port=5000, upnp=True, secure=True):
         self.write("/tmp/miniupnpd.conf", "\n".join((
             "ext_ifname=wan0", f"ext_ip={PUBLIC}", "listening_ip=br0", f"http_port={port}", "enable_natpmp=yes",
-            f"enable_upnp={'yes' if upnp else 'no'}", "secure_mode=yes", "upnp_table_name=home", "upnp_nat_table_name=home",
+            f"enable_upnp={'yes' if upnp else 'no'}", f"secure_mode={'yes' if secure else 'no'}", "upnp_table_name=home", "upnp_nat_table_name=home",
             "upnp_forward_chain=miniupnpd", "upnp_nat_chain=prerouting_miniupnpd",
             "upnp_nat_postrouting_chain=postrouting_miniupnpd", "uuid=00000000-0000-0000-0000-000000000001",
             "force_igd_desc_v1=" + ("yes" if version1 else "no"), "allow 1-65535 192.168.77.0/24 1-65535",

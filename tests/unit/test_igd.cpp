@@ -1,4 +1,4 @@
-// The IGD client against hostile answers, and Reconcile and the test mappings against a router in memory.
+// The IGD client against hostile answers, and the mapping core and the test mappings against a router in memory.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -6,8 +6,8 @@
 #include <set>
 #include <tuple>
 
-#include "daemons/common/Reconcile.h"
 #include "daemons/common/TestMappings.h"
+#include "mapping/Carry.h"
 #include "upnp/Igd.h"
 #include "upnp/Ssdp.h"
 
@@ -168,7 +168,9 @@ public:
     int List(std::vector<RouterMapping>& rgMappings) override {
         ++mNCalls;
         for (const auto& [key, mapping] : mMapTable) {
-            rgMappings.push_back(mapping);
+            if (!mBlListNothing) {
+                rgMappings.push_back(mapping);
+            }
         }
         return mNListCode;
     }
@@ -186,18 +188,19 @@ public:
     int Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
         ++mNCalls;
         const auto it = mMapTable.find({szProtocol, nPort});
-        if (it == mMapTable.end()) {
-            return tavo::kRouterNoSuchEntry;
+        if (mNGetCode != tavo::kRouterOk || it == mMapTable.end()) {
+            return mNGetCode != tavo::kRouterOk ? mNGetCode : static_cast<int>(tavo::kRouterNoSuchEntry);
         }
         mapping = it->second;
         return tavo::kRouterOk;
     }
     int Add(const RouterMapping& mapping) override {
         ++mNCalls;
-        if (mapping.nRouterPort == mNSwallowed) {
-            return tavo::kRouterOk;
+        if (mapping.nRouterPort == mNSwallowed || mNAddCode != tavo::kRouterOk) {
+            return mNAddCode;
         }
-        mMapTable[{mapping.szProtocol, mapping.nRouterPort}] = mapping;
+        RouterMapping& entry = mMapTable[{mapping.szProtocol, mapping.nRouterPort}] = mapping;
+        entry.szDescription = mSzRewritten.empty() ? entry.szDescription : mSzRewritten;
         return tavo::kRouterOk;
     }
     int Remove(const std::string& szProtocol, uint16_t nPort) override {
@@ -210,6 +213,10 @@ public:
 
     std::map<std::pair<std::string, uint16_t>, RouterMapping> mMapTable;
     int mNListCode = tavo::kRouterOk;
+    bool mBlListNothing = false;  // with mNListCode
+    int mNGetCode = tavo::kRouterOk;
+    int mNAddCode = tavo::kRouterOk;
+    std::string mSzRewritten;  // what every description becomes
     int mNRangeCode = tavo::kRouterInvalidAction;
     int mNRemoveCode = tavo::kRouterOk;
     int mNHidden = 0;     // not shown in a range
@@ -237,7 +244,20 @@ std::vector<std::string> Texts(const tavo::PassResult& result) {
     return rgTexts;
 }
 
-TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
+// The core with a memory of its own, at a time that only the test moves.
+struct Core {
+    tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted) {
+        record.TurnTo({"192.168.1.1", ""});
+        return tavo::BringInLine(router, rgWanted, record, habit,
+                                 {kBox, [this] { return nNow; }, [] { return false; }, [this] { ++nSaves; }});
+    }
+    tavo::Record record{"", "boot"};
+    tavo::LeaseHabit habit;
+    int64_t nNow = 1000;
+    int nSaves = 0;
+};
+
+TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     MemoryRouter router;
     for (const RouterMapping& mapping :
          {Entry(1, 1, kBox, "tavo:a"), Entry(2, 2, kBox, "tavo:gone"), Entry(3, 9, kBox, "tavo:moved"),
@@ -247,9 +267,8 @@ TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a"), Entry(3, 3, "", "tavo:moved"),
                                                  Entry(4, 4, "", "tavo:d"), Entry(5, 5, "", "tavo:e"),
                                                  Entry(6, 6, "", "tavo:f"), Entry(7, 7, "", "tavo:g")};
-    tavo::LeaseHabit habit;
-    const auto fnGoOn = [] { return false; };
-    const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn);
+    Core core;
+    const auto result = core.Run(router, rgWanted);
     std::vector<std::string> rgExpected = {"1/tcp 1",
                                            "3/tcp 1 anew",
                                            "4/tcp 718 192.168.1.9 tavo:theirs",
@@ -262,19 +281,25 @@ TEST(Reconcile, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
     EXPECT_EQ((router.mMapTable[{"TCP", 6}].nBoxPort), 9);
     EXPECT_EQ((router.mMapTable[{"TCP", 4}].szClient), "192.168.1.9");
-    EXPECT_EQ(result.nShortestLease, 100U);
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease) << "of an age that nobody knows: renewed";
+    EXPECT_EQ(result.nNextSeconds, 100) << "the other program's lease ends before half of ours is over";
 
     router.mNCalls = 0;
     rgExpected[1] = "3/tcp 1";
     rgExpected[5] = "7/tcp 1";
-    EXPECT_EQ(Texts(tavo::Reconcile(router, rgWanted, kBox, habit, false, fnGoOn)), rgExpected);
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), rgExpected);
     EXPECT_EQ(router.mNCalls, 1);
-    tavo::Reconcile(router, rgWanted, kBox, habit, true, fnGoOn);  // leases due: each own one asked for again
-    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), habit.nLease);
+    router.mMapTable[{"TCP", 1}].nLease = 7;  // what is left, as some show it
+    core.nNow += core.habit.nLease / 2 - 1;
+    core.Run(router, rgWanted);
+    EXPECT_EQ(router.mNCalls, 2) << "not yet";
+    core.nNow += 1;
+    core.Run(router, rgWanted);
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease);
     EXPECT_EQ((router.mMapTable[{"TCP", 5}].szDescription), "game");
 }
 
-TEST(Reconcile, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
+TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
     std::vector<RouterMapping> rgWanted;
     for (uint16_t nPort = 1; nPort <= 10; ++nPort) {
         rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
@@ -292,8 +317,7 @@ TEST(Reconcile, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
         router.mNRangeCode = nCode;
         router.mNHidden = nHidden;
         router.mNSwallowed = nSwallowed;
-        tavo::LeaseHabit habit;
-        const auto result = tavo::Reconcile(router, rgWanted, kBox, habit, false, [] { return false; });
+        const auto result = Core().Run(router, rgWanted);
         EXPECT_EQ(router.mNCalls, nCalls);
         ASSERT_EQ(result.rgOutcomes.size(), 10U);
         EXPECT_EQ(result.rgOutcomes[4].verdict.szWord, szFifth);
@@ -303,25 +327,101 @@ TEST(Reconcile, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
     }
 }
 
-TEST(Reconcile, WhatTheRouterDoesNotTakeAwayIsReported) {
+TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
     MemoryRouter router;
     router.Add(Entry(1, 1, kBox, "tavo:old"));
     router.Add(Entry(2, 9, kBox, "tavo:moved"));
     router.mNRemoveCode = 606;
-    tavo::LeaseHabit habit;
-    const auto result = tavo::Reconcile(router, {Entry(2, 2, "", "tavo:a")}, kBox, habit, false, [] { return false; });
-    EXPECT_EQ(Texts(result), (std::vector<std::string>{"2/tcp 606", "1/tcp 606 left over"}));
+    EXPECT_EQ(Texts(Core().Run(router, {})), (std::vector<std::string>{"1/tcp 606 left over", "2/tcp 606 left over"}));
 }
 
-TEST(Reconcile, ChangesNothingWhenTheTableCannotBeRead) {
+// Where the whole table cannot be read, our own places are asked for; where nothing makes sense, nothing is said of
+// them.
+TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
+    for (const int nListCode : {static_cast<int>(tavo::kRouterTooLong), static_cast<int>(tavo::kRouterTimeout), 401}) {
+        MemoryRouter router;
+        Core core;
+        router.mNListCode = nListCode;
+        router.mBlListNothing = true;
+        router.mSzRewritten = "upnp";
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")})),
+                  (std::vector<std::string>{"1/tcp 1 anew", "2/tcp 1 anew"}));
+        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
+        EXPECT_EQ(router.mMapTable.size(), 1U);
+        router.mMapTable[{"TCP", 2}].szClient = "192.168.1.9";
+        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+        EXPECT_EQ(router.mMapTable.size(), 1U) << "another host has it by now";
+        EXPECT_TRUE(core.record.Here().empty());
+    }
+}
+
+TEST(Mapping, AFormerAddressIsTakenAwayFirstOrWaitedFor) {
+    for (const bool blRefuses : {false, true}) {
+        MemoryRouter router;
+        Core core;
+        router.Add(Entry(1, 1, "192.168.1.4", "upnp"));
+        core.record.TurnTo({"192.168.1.1", ""});
+        core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow};
+        router.mNRemoveCode = blRefuses ? 606 : tavo::kRouterOk;
+        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        EXPECT_EQ(Texts(result), std::vector<std::string>{blRefuses ? "1/tcp 606" : "1/tcp 1 anew"});
+        EXPECT_EQ((router.mMapTable[{"TCP", 1}].szClient), blRefuses ? "192.168.1.4" : kBox);
+        if (blRefuses) {
+            EXPECT_EQ(result.rgOutcomes[0].verdict.enState, tavo::PortState::kWaiting);
+            EXPECT_EQ(result.rgOutcomes[0].verdict.nLease, 3600U);
+            EXPECT_EQ(result.nNextSeconds, 3601);
+            router.mMapTable.clear();  // its lease has ended
+            EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
+        }
+    }
+}
+
+TEST(Mapping, CodesAndNothingButCodesAreNoRouterThatServes) {
     MemoryRouter router;
-    router.Add(Entry(2, 2, kBox, "tavo:old"));
-    router.mNListCode = tavo::kRouterTimeout;
-    tavo::LeaseHabit habit;
-    const auto result = tavo::Reconcile(router, {Entry(1, 1, "", "tavo:a")}, kBox, habit, false, [] { return false; });
-    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp timeout"});
-    EXPECT_EQ(result.nTransport, tavo::kRouterTimeout);
-    EXPECT_EQ(router.mMapTable.size(), 1U);
+    router.mNListCode = 501;
+    router.mBlListNothing = true;
+    router.mNGetCode = 501;
+    router.mNAddCode = 501;
+    Core core;
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow};
+    router.mNRemoveCode = 501;
+    const auto result = core.Run(router, {});
+    EXPECT_EQ(result.nTransport, tavo::kRouterGarbage);
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 501 left over"});
+}
+
+TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    record.Here()[{"TCP", 1}] = {kBox, 11, "\"odd\n]text", true, 100, 5000};
+    record.TurnTo({"192.168.1.1", "cc:dd"});
+    EXPECT_TRUE(record.Here().empty()) << "another device at the same address";
+    record.Here()[{"UDP", 2}] = {kBox, 2, "tavo:b", true, 0, 5000};
+    const std::string szText = record.Text();
+
+    tavo::Record same(szText, "one");
+    same.TurnTo({"10.0.0.1", "aa:bb"});  // the same device has another address
+    ASSERT_EQ(same.Here().size(), 1U);
+    const tavo::Made& made = same.Here()[{"TCP", 1}];
+    EXPECT_EQ(made.szText, "\"odd\n]text");
+    EXPECT_TRUE(made.IsEntry(Entry(1, 11, kBox, "any")));
+    EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "any")));
+    EXPECT_FALSE(made.IsEntry(Entry(1, 11, "192.168.1.9", "\"odd\n]text")));
+    EXPECT_EQ(std::make_tuple(made.IsDue(5049), made.IsDue(5050), made.End()), std::make_tuple(false, true, 5100));
+
+    tavo::Record later(szText, "two");
+    later.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_TRUE((later.Here()[{"TCP", 1}].IsDue(0)));
+    later.TurnTo({"10.9.9.9", "ee:ff"});
+    later.Prune(100 + 60);
+    EXPECT_EQ(tavo::Record(later.Text(), "two").Text(), later.Text());
+    later.Prune(100 + 61);
+    later.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_TRUE(later.Here().empty()) << "its lease has surely ended, whenever it was asked for";
+    later.TurnTo({"192.168.1.1", "cc:dd"});
+    EXPECT_EQ(later.Here().size(), 1U) << "this one never ends";
+    EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
 }
 
 // A router under test: some ports conflict, and some answers are lost after the work was done.

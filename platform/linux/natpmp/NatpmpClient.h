@@ -10,7 +10,7 @@
 #include <functional>
 #include <string>
 
-#include "upnp/Router.h"
+#include "mapping/Router.h"
 
 namespace tavo {
 

@@ -25,7 +25,8 @@ constexpr size_t kMaxText = 256;
 constexpr int kMaxDepth = 12;
 constexpr int kLeastErrorCode = 100;  // no protocol has less, and as a status "1" is success
 constexpr int kMaxEntries = 65536;
-constexpr auto kListLimit = std::chrono::seconds(30);
+constexpr size_t kRangeEntries = 64;                  // of one answer
+constexpr auto kListLimit = std::chrono::seconds(8);  // then who asks goes on by name
 constexpr char kEncoding[] = "http://schemas.xmlsoap.org/soap/encoding/";
 constexpr char kEnvelope[] = "http://schemas.xmlsoap.org/soap/envelope/";
 
@@ -360,7 +361,8 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
     std::set<std::pair<std::string, uint16_t>> setSeen;
     for (int i = 0; i < kMaxEntries; ++i) {
         if (std::chrono::steady_clock::now() > end) {
-            return kRouterTimeout;
+            rgMappings = std::move(rgRead);
+            return kRouterTooLong;
         }
         RouterMapping mapping;
         const int nCode = GetAt(i, mapping);

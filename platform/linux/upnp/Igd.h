@@ -9,7 +9,7 @@
 
 #include "core/Export.h"
 #include "upnp/Http.h"
-#include "upnp/Router.h"
+#include "mapping/Router.h"
 
 namespace tavo {
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "core/Export.h"
-#include "upnp/Router.h"
+#include "mapping/Router.h"
 
 namespace tavo {
 

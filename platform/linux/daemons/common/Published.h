@@ -6,7 +6,7 @@
 #include <ctime>
 #include <string>
 
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 
 namespace tavo {
 

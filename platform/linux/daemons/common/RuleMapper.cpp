@@ -165,6 +165,9 @@ int RuleMapper::SecondsToNext(const PassResult& result) {
     if (!mBlMended) {
         return std::min(mNCheckSeconds, kRetrySeconds);
     }
+    if (result.nNextSeconds > 0) {
+        return std::min(mNCheckSeconds, result.nNextSeconds);
+    }
     if (mNLease == 0) {
         return mNCheckSeconds;
     }

@@ -14,11 +14,11 @@
 #include "daemons/common/BootClock.h"
 #include "daemons/common/Daemon.h"
 #include "daemons/common/Published.h"
-#include "daemons/common/Reconcile.h"
 #include "daemons/common/RouterTurn.h"
 #include "daemons/common/Teller.h"
 #include "daemons/common/ToldFile.h"
 #include "daemons/common/Wanted.h"
+#include "mapping/Pass.h"
 
 namespace tavo {
 

@@ -9,8 +9,8 @@
 #include <string>
 #include <vector>
 
-#include "daemons/common/Pass.h"
-#include "daemons/common/Reconcile.h"
+#include "mapping/Carry.h"
+#include "mapping/Pass.h"
 #include "upnp/TestRules.h"
 
 namespace tavo {

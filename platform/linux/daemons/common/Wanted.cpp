@@ -131,12 +131,4 @@ WantedSet ReadWanted(const char* szRunKey) {
     return wanted;
 }
 
-std::string MappingName(const RouterMapping& mapping) {
-    return PortName(mapping.szProtocol, mapping.nRouterPort);
-}
-
-Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
-    return {MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort};
-}
-
 }  // namespace tavo

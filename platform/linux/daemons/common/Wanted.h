@@ -7,9 +7,9 @@
 #include <string>
 #include <vector>
 
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 #include "tavo/portforward.h"
-#include "upnp/Router.h"
+#include "mapping/Router.h"
 
 namespace tavo {
 
@@ -36,10 +36,5 @@ std::string MappingDescription(const TAVO_PF_CONF* pRule);
 std::string RuleTitle(const TAVO_PF_CONF* pRule);
 // A rule as text for a user, and fit to be a key of the status file: no separator, no end of line in it.
 std::string RuleName(const TAVO_PF_CONF* pRule);
-
-// "5000/tcp", as a user reads it.
-std::string MappingName(const RouterMapping& mapping);
-// What became of a mapping.
-Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict);
 
 }  // namespace tavo

@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "daemons/common/Pass.h"
+#include "mapping/Pass.h"
 #include "daemons/natpmpd/EpochWatch.h"
 #include "daemons/natpmpd/HeldMappings.h"
 #include "natpmp/NatpmpClient.h"

@@ -15,7 +15,7 @@
 
 #include "core/Descriptor.h"
 #include "core/Directory.h"
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 
 namespace tavo {
 

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 #include "tavo/portforward.h"
 
 namespace tavo {

@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 #include "daemons/tavoportforward/Jobs.h"
 
 namespace tavo {

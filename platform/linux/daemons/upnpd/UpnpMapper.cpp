@@ -1,9 +1,10 @@
-// Keeps the gateway's UPnP mappings in line with the rules. Relies on the IGD client and Reconcile.
+// Keeps the gateway's UPnP mappings in line with the rules. Relies on the IGD client and the mapping core.
 // Promises: see RuleMapper.h.
 #include "daemons/upnpd/UpnpMapper.h"
 
 #include <utility>
 
+#include "net/Neighbour.h"
 #include "upnp/Known.h"
 
 namespace tavo {
@@ -12,12 +13,13 @@ namespace {
 
 constexpr DaemonNames kNames{
     "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
+constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
 constexpr int kDiscoveryMilliseconds = 8000;
 constexpr int kOutsideMilliseconds = 2000;
 
 }  // namespace
 
-UpnpMapper::UpnpMapper() : RuleMapper(kNames, false) {}
+UpnpMapper::UpnpMapper() : RuleMapper(kNames, false), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();
@@ -47,8 +49,9 @@ void UpnpMapper::Remember() const {
     KeepRouter(Gateway(), {mSzLocation, mHabit.blPermanentOnly});
 }
 
-PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool blRenew,
-                               const std::function<bool()>& fnStop) {
+PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
+    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});
+    mMade.Get().Prune(BootSeconds());
     if (!FindRouter(fnStop)) {
         PassResult result = Failed(rgWanted, "noigd", RouterState::kNoService);
         result.blStopped = fnStop();
@@ -57,7 +60,8 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool 
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     const bool blPermanentOnly = mHabit.blPermanentOnly;
-    PassResult result = Reconcile(*mPIgd, rgWanted, Box(), mHabit, blRenew, fnStop);
+    PassResult result =
+        BringInLine(*mPIgd, rgWanted, mMade.Get(), mHabit, {Box(), BootSeconds, fnStop, [this] { mMade.Save(); }});
     result.enRouter = result.nTransport == kRouterOk ? RouterState::kOk : RouterState::kSilent;
     if (blPermanentOnly != mHabit.blPermanentOnly) {
         Remember();
@@ -65,13 +69,14 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, bool 
     return result;
 }
 
-PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+// The record knows what is due.
+PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool /*blRenew*/,
                            const std::function<bool()>& fnStop) {
-    const PassResult result = MapOnce(rgWanted, blRenew, fnStop);
+    const PassResult result = MapOnce(rgWanted, fnStop);
     // A router that restarted often has its service at another port: look for it at once.
     if (result.nTransport == kRouterUnreachable && mPIgd != nullptr && !result.blStopped) {
         LostRouter();
-        return MapOnce(rgWanted, blRenew, fnStop);
+        return MapOnce(rgWanted, fnStop);
     }
     return result;
 }

@@ -1,11 +1,13 @@
 // The mapping side of upnpd: the gateway's IGD kept in line with the rules.
-// Relies on the IGD client and Reconcile. Promises: see RuleMapper.h.
+// Relies on the IGD client and the mapping core. Promises: see RuleMapper.h.
 #pragma once
 
 #include <memory>
 #include <string>
 
+#include "daemons/common/MadeFile.h"
 #include "daemons/common/RuleMapper.h"
+#include "mapping/Carry.h"
 #include "upnp/Igd.h"
 
 namespace tavo {
@@ -24,11 +26,12 @@ private:
 
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
-    PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, bool blRenew, const std::function<bool()>& fnStop);
+    PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     std::string mSzLocation;
     std::unique_ptr<Igd> mPIgd;
     LeaseHabit mHabit;
+    MadeFile mMade;
 };
 
 }  // namespace tavo

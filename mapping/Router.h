@@ -6,8 +6,6 @@
 #include <string>
 #include <vector>
 
-#include "core/Export.h"
-
 namespace tavo {
 
 // Every description that we give to a rule's mapping begins with this; it tells ours from everybody else's.
@@ -31,6 +29,7 @@ enum RouterCode : int {
     kRouterTimeout = -1,
     kRouterUnreachable = -2,
     kRouterGarbage = -3,
+    kRouterTooLong = -4,  // a table that could not be read to its end in time
     kRouterInvalidAction = 401,
     kRouterInvalidArgs = 402,
     kRouterNoSuchIndex = 713,
@@ -39,10 +38,10 @@ enum RouterCode : int {
     kRouterOnlyPermanentLeases = 725
 };
 
-class TAVO_PLATFORM_API Router {
+class __attribute__((visibility("default"))) Router {
 public:
     virtual ~Router() = default;
-    // Outputs are set only with kRouterOk.
+    // Outputs are set only with kRouterOk; with kRouterTooLong, List() has what was read.
     virtual int List(std::vector<RouterMapping>& rgMappings) = 0;
     // The box's own mappings between two ports, where the router can show them at once. May leave some
     // out: what it shows is there, what it does not show may be there too.

@@ -1,5 +1,5 @@
 // The words for what became of a mapping. Relies on nothing. Promises: see Outcome.h.
-#include "daemons/common/Outcome.h"
+#include "mapping/Outcome.h"
 
 #include <algorithm>
 #include <string_view>
@@ -55,6 +55,14 @@ size_t CharacterSize(std::string_view szText) {
 }
 
 }  // namespace
+
+std::string MappingName(const RouterMapping& mapping) {
+    return std::to_string(mapping.nRouterPort) + (mapping.szProtocol == "UDP" ? "/udp" : "/tcp");
+}
+
+Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
+    return {MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort};
+}
 
 std::string WhyOf(const Verdict& verdict) {
     if (!verdict.szWhy.empty()) {

@@ -2,11 +2,12 @@
 // Promises: a pass is over well before a save stops waiting for it, whatever the router does.
 #pragma once
 
-#include <chrono>
+#include <cstdint>
+#include <ctime>
 #include <functional>
 
-#include "daemons/common/Outcome.h"
-#include "upnp/Router.h"
+#include "mapping/Outcome.h"
+#include "mapping/Router.h"
 
 namespace tavo {
 
@@ -15,17 +16,26 @@ struct PassResult {
     uint32_t nShortestLease = 0;  // seconds granted; 0: all permanent
     int nTransport = kRouterOk;   // below 0: why the router could not be spoken to
     bool blStopped = false;
+    int nNextSeconds = 0;    // until something has to be done again; 0: nothing has to
     bool blRenewed = false;  // every lease was asked for anew, due or not
     RouterState enRouter = RouterState::kNotAsked;
 };
 
+// Seconds of a clock that never jumps and goes on while the box sleeps.
+inline int64_t BootSeconds() {
+    timespec time = {};
+    clock_gettime(CLOCK_BOOTTIME, &time);
+    return time.tv_sec;
+}
+
 class PassGuard {
 public:
-    PassGuard(PassResult& result, const std::function<bool()>& fnStop) : mResult(result), mFnStop(fnStop) {}
+    PassGuard(PassResult& result, const std::function<bool()>& fnStop, std::function<int64_t()> fnNow = BootSeconds)
+        : mResult(result), mFnStop(fnStop), mFnNow(std::move(fnNow)), mNEnd(mFnNow() + kPassLimit) {}
 
     bool IsOver() {
         mResult.blStopped = mResult.blStopped || mFnStop();
-        if (std::chrono::steady_clock::now() > mEnd && mResult.nTransport == kRouterOk) {
+        if (mFnNow() > mNEnd && mResult.nTransport == kRouterOk) {
             mResult.nTransport = kRouterTimeout;
         }
         return mResult.blStopped || mResult.nTransport != kRouterOk;
@@ -40,12 +50,13 @@ public:
     }
 
 private:
-    static constexpr auto kPassLimit = std::chrono::seconds(150);  // well below the five minutes that a save waits
-    static constexpr int kTransportTries = 2;                      // silent answers in a row before a pass gives up
+    static constexpr int64_t kPassLimit = 150;  // seconds, well below the five minutes that a save waits
+    static constexpr int kTransportTries = 2;   // silent answers in a row before a pass gives up
 
     PassResult& mResult;
     const std::function<bool()>& mFnStop;
-    std::chrono::steady_clock::time_point mEnd = std::chrono::steady_clock::now() + kPassLimit;
+    std::function<int64_t()> mFnNow;
+    int64_t mNEnd;
     int mNSilent = 0;
 };
 

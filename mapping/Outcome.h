@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+#include "mapping/Router.h"
+
 namespace tavo {
 
 // What is known of a port at the router.
@@ -60,6 +62,11 @@ struct Outcome {
     bool blLeftOver = false;  // no rule asks for it, and the router did not take it away
 };
 using OutcomeList = std::vector<Outcome>;
+
+// "5000/tcp", as a user reads it.
+std::string MappingName(const RouterMapping& mapping);
+// What became of a mapping.
+Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict);
 
 // Why a port is not open, or by whose doing it is, as a user reads it; empty for an own open one.
 std::string WhyOf(const Verdict& verdict);

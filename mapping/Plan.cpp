@@ -1,0 +1,67 @@
+// See Plan.h.
+#include "mapping/Plan.h"
+
+namespace tavo {
+
+namespace {
+
+Step Unwanted(const PlaceView& view, const std::string& szBox) {
+    switch (view.enSeen) {
+        case Seen::kUnknown:
+            return view.pMade == nullptr ? Step{} : Step{Action::kLook, "no rule asks for it, and it may be there"};
+        case Seen::kHidden:
+            return view.pMade == nullptr ? Step{} : Step{Action::kRemove, "no rule asks for what we made here"};
+        case Seen::kAbsent:
+            return view.pMade == nullptr ? Step{} : Step{Action::kForget, "the router has it no more"};
+        default:
+            break;
+    }
+    if (IsOurs(*view.pEntry, view.pMade, szBox)) {
+        return {Action::kRemove, "no rule asks for it"};
+    }
+    return view.pMade == nullptr ? Step{} : Step{Action::kForget, "somebody else has the place by now"};
+}
+
+Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNow) {
+    const RouterMapping& entry = *view.pEntry;
+    if (!IsOurs(entry, view.pMade, szBox)) {
+        return Serves(entry, *view.pWanted, szBox) ? Step{Action::kLeave, "another program of this box made it"}
+                                                   : Step{Action::kInTheWay, "somebody else has the place"};
+    }
+    if (entry.szClient != szBox) {
+        return {Action::kReplace, "it leads to an address that this box had before"};
+    }
+    if (!Serves(entry, *view.pWanted, szBox)) {
+        return {Action::kChange, "it is to lead to another port of this box"};
+    }
+    // One without our record was made before there was one: nobody knows how old its lease is.
+    const bool blDue = entry.nLease != 0 && (view.pMade == nullptr || view.pMade->IsDue(nNow));
+    return blDue ? Step{Action::kRenew, "half of its lease is over"} : Step{Action::kKeep, "as it is to be"};
+}
+
+}  // namespace
+
+bool IsOurs(const RouterMapping& entry, const Made* pMade, const std::string& szBox) {
+    return (pMade != nullptr && pMade->IsEntry(entry)) ||
+           (entry.szClient == szBox && entry.szDescription.starts_with(kOwnPrefix));
+}
+
+bool Serves(const RouterMapping& entry, const RouterMapping& wanted, const std::string& szBox) {
+    return entry.szClient == szBox && entry.nBoxPort == wanted.nBoxPort && entry.blEnabled;
+}
+
+Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow) {
+    if (view.pWanted == nullptr) {
+        return Unwanted(view, szBox);
+    }
+    switch (view.enSeen) {
+        case Seen::kUnknown:
+            return {Action::kLook, "a rule asks for it"};
+        case Seen::kPresent:
+            return WantedAndThere(view, szBox, nNow);
+        default:
+            return {Action::kAdd, "a rule asks for it, and the router does not show it"};
+    }
+}
+
+}  // namespace tavo

@@ -1,0 +1,86 @@
+// What this box has made at routers, or may have made: the memory that tells our mappings from everybody else's.
+// Relies on a text that it is given and hands back; no file, no clock.
+// Promises: a row goes only when the router has shown that the mapping is gone, or when its lease has surely ended;
+// a text that is damaged loses the rows that cannot be read, and no other.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "mapping/Router.h"
+
+namespace tavo {
+
+// A place in a router's table.
+using MappingKey = std::pair<std::string, uint16_t>;  // "TCP" or "UDP", the router's port
+
+inline MappingKey KeyOf(const RouterMapping& mapping) {
+    return {mapping.szProtocol, mapping.nRouterPort};
+}
+
+// A router is its hardware where that is known, whatever address it has; else its address.
+struct RouterName {
+    std::string szGateway;
+    std::string szHardware;
+
+    bool IsSame(const RouterName& other) const {
+        return szHardware.empty() || other.szHardware.empty() ? szGateway == other.szGateway
+                                                              : szHardware == other.szHardware;
+    }
+};
+
+// One mapping of ours.
+struct Made {
+    std::string szClient;  // the box's own address when it was made
+    uint16_t nBoxPort = 0;
+    std::string szText;     // as the router shows it; until then, as it was given
+    bool blShown = false;   // else it was asked for, or for a change of it, and may not be there
+    uint32_t nLease = 0;    // seconds from nAsked; 0: until the router restarts
+    int64_t nAsked = 0;     // seconds of boot time; of an earlier boot: 0
+    bool blBefore = false;  // asked for before this boot, so that nobody knows how long ago
+
+    // Whether an entry at its place is this one. Routers rewrite texts: until it is shown, what it leads to will do.
+    bool IsEntry(const RouterMapping& entry) const {
+        const bool blPort = entry.nBoxPort == nBoxPort;
+        const bool blText = entry.szDescription == szText;
+        return entry.szClient == szClient && (blShown ? blPort && blText : blPort || blText);
+    }
+    bool IsDue(int64_t nNow) const { return blBefore || (nLease != 0 && nNow - nAsked >= nLease / 2); }
+    // Boot time at which the router has ended it by itself; -1: never, or nobody knows.
+    int64_t End() const { return nLease == 0 ? -1 : nAsked + nLease; }
+};
+
+class Record {
+public:
+    using Rows = std::map<MappingKey, Made>;
+    // szText: what the last Text() was, empty for none. szBoot: what tells this boot from every other one.
+    Record(std::string_view szText, std::string szBoot);
+
+    // The rows of one router, to be read and changed; those of the others wait.
+    void TurnTo(const RouterName& router);
+    Rows& Here() { return mHere; }
+    const Rows& Here() const { return mHere; }
+
+    // Drops the rows of other routers that have surely run out.
+    void Prune(int64_t nNow);
+    std::string Text() const;
+
+private:
+    struct Elsewhere {
+        RouterName router;
+        MappingKey key;
+        Made made;
+    };
+
+    std::string mSzBoot;
+    RouterName mRouter;
+    Rows mHere;
+    std::vector<Elsewhere> mRgElsewhere;
+};
+
+}  // namespace tavo

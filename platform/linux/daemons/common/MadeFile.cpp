@@ -1,0 +1,42 @@
+// See MadeFile.h.
+#include "daemons/common/MadeFile.h"
+
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <fstream>
+
+#include "core/TextFile.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr char kStateDir[] = "/var/lib/tavo";
+
+std::string BootId() {
+    std::ifstream file("/proc/sys/kernel/random/boot_id");
+    std::string szId;
+    std::getline(file, szId);
+    return szId;
+}
+
+}  // namespace
+
+MadeFile::MadeFile(const char* szPath)
+    : mSzPath(szPath), mSzWritten(ReadFile(szPath).value_or("")), mRecord(mSzWritten, BootId()) {}
+
+void MadeFile::Save() {
+    std::string szText = mRecord.Text();
+    if (szText == mSzWritten) {
+        return;
+    }
+    mkdir(kStateDir, 0755);
+    if (!WriteFileAtomic(mSzPath, szText)) {
+        syslog(LOG_ERR, "cannot write %s: mappings may outlive a crash", mSzPath);
+        return;
+    }
+    mSzWritten = std::move(szText);
+}
+
+}  // namespace tavo

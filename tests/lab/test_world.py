@@ -1,0 +1,94 @@
+"""The world moves while rules are in force: the box's address, and routers that forget, rewrite, or are slow to tell."""
+import json
+import signal
+import time
+import unittest
+
+import homelab
+from homelab import BOX, GATEWAY, sh, wait_for
+
+LAB = None
+NEW = "192.168.77.5"
+PUBLISHED = "/run/tavo/upnpd.json"
+
+
+def own_address(new, old):
+    sh(f"ip -n box addr add {new}/24 dev box0 && ip -n box addr del {old}/24 dev box0 && "
+       f"ip -n box route replace default via {GATEWAY}")
+
+
+class World(unittest.TestCase):
+    def setUp(self):
+        LAB.install()
+        LAB.settings(check_interval=1, lease=20)
+
+    def tearDown(self):
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.end(LAB.router)
+        LAB.clear_state()
+
+    def test_the_box_has_another_address(self):
+        """A router that lets nobody else delete an entry keeps the old one until its lease ends, and that is said."""
+        for secure in (False, True):
+            with self.subTest(secure=secure):
+                LAB.start_router(secure=secure)
+                self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+                self.assertTrue(LAB.reaches("tcp", 5001))
+                own_address(NEW, BOX)
+                self.addCleanup(sh, f"ip -n box addr del {NEW}/24 dev box0", check=False)
+                try:
+                    if secure:
+                        wait_for(lambda: "former address" in LAB.read(PUBLISHED), 10, "what is waited for is said")
+                        row = json.loads(LAB.read(PUBLISHED))["rules"][0]
+                        self.assertEqual((row["state"], row["word"]), ("waiting", "606"))
+                        self.assertLess(row["until"] - time.time(), 21)
+                    wait_for(lambda: LAB.mappings() == {("tcp", 5001): (NEW, 5001)}, 30, "it leads to the new address")
+                    self.assertTrue(LAB.reaches("tcp", 5001))
+                    LAB.stop_daemon(signal.SIGTERM)
+                    self.assertEqual(LAB.mappings(), {})
+                finally:
+                    own_address(BOX, NEW)
+                self.tearDown()
+                self.setUp()
+        LAB.start_router()
+
+    def test_rules_go_with_the_old_address_gone(self):
+        LAB.start_router(secure=False)
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        LAB.stop_daemon(signal.SIGKILL)
+        own_address(NEW, BOX)
+        try:
+            self.assertEqual(LAB.save()["result"], 0)
+            wait_for(lambda: LAB.mappings() == {}, 10, "nothing leads to whoever gets the old address")
+        finally:
+            own_address(BOX, NEW)
+
+    def test_a_router_that_rewrites_texts(self):
+        LAB.settings(check_interval=1, lease=20)
+        LAB.start_scripted("rewrites")
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")["status"], 0)
+        wait_for(lambda: LAB.scripted()["count"]["AddPortMapping"] > 2, 15, "leases are renewed")
+        self.assertEqual(LAB.save("2,1,tcp,5002,5002")["status"], 0)
+        self.assertEqual([row[1] for row in LAB.scripted()["table"]], [5002])
+
+    def test_a_router_that_lists_slowly(self):
+        LAB.start_scripted("slow_table")
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001", seconds=60)["status"], 0)
+        self.assertEqual(LAB.save(seconds=60)["result"], 0)
+        wait_for(lambda: [row for row in LAB.scripted()["table"] if row[2] == BOX] == [], 30, "ours is gone")
+
+    def test_very_many_ports(self):
+        """A listing of some hundred and thirty entries at once ends the router's daemon."""
+        LAB.settings()
+        LAB.start_router()
+        for ports in (150, 1024):
+            with self.subTest(ports=ports):
+                last = 10000 + ports
+                self.assertEqual(LAB.save(f"1,1,tcp,10001-{last},10001-{last}", seconds=200)["status"], 0)
+                self.assertEqual(len(LAB.mappings()), ports)
+                self.assertEqual(LAB.save(seconds=200)["result"], 0)
+                wait_for(lambda: LAB.mappings() == {}, 60, "none is left")
+
+
+if __name__ == "__main__":
+    homelab.run_tests(lambda lab: lab.serve(5001))

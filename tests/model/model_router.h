@@ -1,0 +1,82 @@
+// A model of a home router's table of port mappings: its habits and its faults are chosen by a seed, its time is moved
+// by the test. It knows the truth that the code under test can only ask for.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "mapping/Record.h"
+#include "mapping/Router.h"
+
+namespace model {
+
+// Thrown where our process is killed: before or after a request took effect.
+struct Killed {};
+
+struct Habits {
+    bool blPermanentOnly = false;
+    bool blForgetsLease = false;  // makes it with a lease, and lists none
+    bool blListsWhatIsLeft = false;
+    uint32_t nLongestLease = 0;  // 0: any
+    int nText = 0;               // 0 kept, 1 rewritten, 2 dropped
+    bool blSecure = false;       // only the client may make, change and delete its entries
+    bool blOverwrites = true;    // a client's own entry at its place; else 718 for any change
+    size_t nCapacity = 1000;
+    bool blSaysFull = true;  // else it says yes and keeps nothing
+    int nListCode = 0;       // what a listing answers; below 0 with the first entries
+    bool blRanges = false;
+};
+
+class Router : public tavo::Router {
+public:
+    Router(std::mt19937& random, const int64_t& nNow) : mRandom(random), mNNow(nNow) {}
+
+    struct Entry {
+        tavo::RouterMapping mapping;
+        int64_t nEnd = 0;    // 0: never
+        bool blBox = false;  // made by the code under test
+    };
+
+    int List(std::vector<tavo::RouterMapping>& rgMappings) override;
+    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                  std::vector<tavo::RouterMapping>& rgMappings) override;
+    int Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override;
+    int Add(const tavo::RouterMapping& mapping) override;
+    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override;
+
+    // ---- the world's side -----------------------------------------------------------------------
+
+    // Ends the leases that are over.
+    void Expire();
+    // What is there now, without asking.
+    const Entry* At(const tavo::MappingKey& key);
+    void Restart() { mMapTable.clear(); }
+
+    Habits habits;
+    std::string szBox;      // who asks
+    bool blAway = false;    // answers nothing
+    int nLosePerMille = 0;  // answers that are lost, after or before the request took effect
+    int nKillPerMille = 0;  // requests at which our process dies
+    std::map<tavo::MappingKey, Entry> mMapTable;
+    int nRequests = 0;
+    std::function<void(std::string)> fnTell;  // each change that is asked for
+    std::string szBroken;                     // a promise that a request of ours has broken
+
+private:
+    bool Chance(int nPerMille) { return static_cast<int>(mRandom() % 1000) < nPerMille; }
+    // What becomes of a request before it takes effect, and of its answer afterwards.
+    template <typename Effect>
+    int Answer(Effect fnEffect);
+    tavo::RouterMapping Shown(const Entry& entry) const;
+    int DoAdd(const tavo::RouterMapping& mapping);
+    int DoRemove(const tavo::MappingKey& key);
+
+    std::mt19937& mRandom;
+    const int64_t& mNNow;
+};
+
+}  // namespace model

@@ -1,0 +1,342 @@
+// The mapping core against a model of a router, for months in a time that only the test moves. A seed chooses the
+// router's habits, what happens, and when; the promises are checked after every pass.
+//   test_model [SEEDS [FIRST]]   a seed that fails is printed with its last events
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <deque>
+#include <memory>
+#include <optional>
+#include <set>
+#include <utility>
+
+#include "mapping/Carry.h"
+#include "model_router.h"
+
+namespace {
+
+using tavo::MappingKey;
+using tavo::RouterMapping;
+
+constexpr int kEvents = 150;                // of one life
+constexpr int64_t kMostBetween = 3 * 3600;  // seconds from one event to the next
+constexpr int kRetrySeconds = 10;           // as the daemons wait after a pass that failed
+constexpr uint16_t kPorts = 12;
+constexpr size_t kStory = 60;  // events that are told of a life that failed
+constexpr char kStranger[] = "192.168.1.9";
+// Passes after the last trouble (lost answers, a kill, a router that was away) by which everything is as it is to be:
+// the first may still learn that an answer was lost, the second puts it right.
+constexpr int kPassesToPeace = 2;
+
+class Life {
+public:
+    explicit Life(unsigned nSeed) : mRandom(nSeed), mRouter(mRandom, mNNow) {
+        model::Habits& habits = mRouter.habits;
+        habits.blPermanentOnly = OneIn(5);
+        habits.blForgetsLease = OneIn(6);
+        habits.blListsWhatIsLeft = OneIn(2);
+        habits.nLongestLease = OneIn(4) && !habits.blPermanentOnly ? 60U + Pick(7200) : 0;
+        habits.nText = OneIn(2) ? 0 : static_cast<int>(Pick(3));
+        habits.blSecure = OneIn(2);
+        habits.blOverwrites = !OneIn(3);
+        habits.nCapacity = OneIn(4) ? 4 + Pick(8) : 1000;
+        habits.blSaysFull = OneIn(2);
+        const int rgListCodes[] = {0, 0, 0, tavo::kRouterTooLong, 401, 501};
+        habits.nListCode = rgListCodes[Pick(6)];
+        habits.blRanges = OneIn(3);
+        mNCheck = OneIn(2) ? 120 : 600;
+        mRouter.szBox = "192.168.1.5";
+        mRouter.fnTell = [this](std::string szWhat) { Tell("  " + std::move(szWhat)); };
+        Boot();
+    }
+
+    // Nothing: every promise was kept.
+    std::optional<std::string> Live() {
+        for (int i = 0; i < kEvents && mSzBroken.empty(); ++i) {
+            Happen();
+            const int64_t nUntil = mNNow + Pick(kMostBetween);
+            while (mSzBroken.empty() && mNNext <= nUntil) {
+                mNNow = std::max(mNNow, mNNext);
+                RunPass();
+            }
+            mNNow = std::max(mNNow, nUntil);
+        }
+        return mSzBroken.empty() ? std::nullopt : std::optional(mSzBroken);
+    }
+    const std::deque<std::string>& Story() const { return mStory; }
+    int64_t Seconds() const { return mNNow; }
+
+private:
+    unsigned Pick(int64_t nFrom) { return static_cast<unsigned>(mRandom() % static_cast<unsigned>(nFrom)); }
+    bool OneIn(int64_t nTimes) { return Pick(nTimes) == 0; }
+    void Tell(std::string szWhat) {
+        mStory.push_back(std::to_string(mNNow) + " s: " + std::move(szWhat));
+        if (mStory.size() > kStory) {
+            mStory.pop_front();
+        }
+    }
+    MappingKey AnyKey() { return {OneIn(2) ? "TCP" : "UDP", static_cast<uint16_t>(1 + Pick(kPorts))}; }
+
+    // The process begins anew with what is on the disk, perhaps after a boot.
+    void Start() {
+        mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
+        mHabit = {};
+        mNNext = mNNow;
+        Trouble();
+    }
+    void Boot() {
+        ++mNBoots;
+        mNBootAt = mNNow;
+        Start();
+    }
+    void Trouble() { mNPeace = 0; }
+
+    // ---- what happens ------------------------------------------------------------------------------
+
+    void Happen() {
+        const bool blQuiet = std::exchange(mBlQuiet, false);
+        switch (Pick(13)) {
+            case 0:
+            case 1:
+            case 2:
+                ChangeRules();
+                break;
+            case 3:
+                mRouter.szBox = "192.168.1." + std::to_string(5 + Pick(3));
+                Tell("own address " + mRouter.szBox);
+                mNNext = mNNow;
+                break;
+            case 4:
+                mRouter.Restart();
+                Tell("router restarts");
+                break;
+            case 5:
+                mRouter.blAway = !mRouter.blAway;
+                Tell(mRouter.blAway ? "router away" : "router back");
+                break;
+            case 6:
+                mRouter.nLosePerMille = mRouter.nLosePerMille == 0 ? 100 : 0;
+                Tell("answers lost: " + std::to_string(mRouter.nLosePerMille));
+                break;
+            case 7:
+                mRouter.nKillPerMille = 100;
+                Tell("a kill comes");
+                mNNext = mNNow;
+                break;
+            case 8:
+                Boot();
+                Tell("boot");
+                break;
+            case 9:
+            case 10:
+                Stranger();
+                break;
+            case 11:
+                SwapRouters();
+                break;
+            default:
+                Tell("nothing");
+                mBlQuiet = blQuiet;
+                return;
+        }
+        Trouble();
+    }
+
+    void ChangeRules() {
+        mRgWanted.clear();
+        std::set<MappingKey> setKeys;
+        for (unsigned i = Pick(8); i > 0; --i) {
+            const MappingKey key = AnyKey();
+            if (setKeys.insert(key).second) {
+                mRgWanted.push_back({key.first, key.second, static_cast<uint16_t>(100 + Pick(3)), "",
+                                     OneIn(2) ? "tavo:a" : "tavo:b", 0, true});
+            }
+        }
+        Tell(std::to_string(mRgWanted.size()) + " rules");
+        mNNext = mNNow;
+    }
+
+    // Another host, or another program of this box, takes a place or leaves it.
+    void Stranger() {
+        const MappingKey key = AnyKey();
+        const model::Router::Entry* pEntry = mRouter.At(key);
+        if (pEntry == nullptr) {
+            const std::string szClient = OneIn(2) ? kStranger : mRouter.szBox;
+            mRouter.mMapTable[key] = {{key.first, key.second, static_cast<uint16_t>(200 + Pick(3)), szClient,
+                                       mRouter.habits.nText == 1 ? "upnp mapping" : "game", 0, true}};
+            Tell("stranger " + szClient + " takes " + key.first + std::to_string(key.second));
+        } else if (!pEntry->blBox) {
+            mRouter.mMapTable.erase(key);
+            Tell("stranger leaves " + key.first + std::to_string(key.second));
+        }
+    }
+
+    // Another device at the gateway's address, and the first one again.
+    void SwapRouters() {
+        std::swap(mRouter.mMapTable, mMapOther);
+        mBlOther = !mBlOther;
+        Tell(mBlOther ? "other router" : "first router again");
+        mNNext = mNNow;
+    }
+
+    // ---- a pass ----------------------------------------------------------------------------------------
+
+    void RunPass() {
+        const auto mapBefore = mRouter.mMapTable;
+        const int64_t nAllowance = mRouter.nLosePerMille + mRouter.nKillPerMille + (mRouter.blAway ? 1 : 0);
+        mPRecord->TurnTo({"192.168.1.1", mBlOther ? "bb" : "aa"});
+        mHabit.nLease = 3600;
+        tavo::PassResult result;
+        try {
+            mPRecord->Prune(mNNow - mNBootAt);
+            result = tavo::BringInLine(mRouter, mRgWanted, *mPRecord, mHabit,
+                                       {mRouter.szBox, [this] { return mNNow - mNBootAt; }, [] { return false; },
+                                        [this] { mSzDisk = mPRecord->Text(); }});
+        } catch (const model::Killed&) {
+            mRouter.nKillPerMille = 0;
+            Tell("killed");
+            Start();
+            CheckStrangers(mapBefore);
+            return;
+        }
+        mRouter.nKillPerMille = 0;
+        const bool blWell = result.nTransport == tavo::kRouterOk;
+        const int nNext = result.nNextSeconds > 0 ? std::min(mNCheck, result.nNextSeconds) : mNCheck;
+        mNNext = mNNow + (blWell ? nNext : std::min(mNCheck, kRetrySeconds));
+        mNPeace = nAllowance == 0 && blWell ? mNPeace + 1 : 0;
+        CheckStrangers(mapBefore);
+        CheckWords(result, nAllowance != 0);
+        if (mNPeace >= kPassesToPeace) {
+            CheckPeace(result);
+        }
+        mBlQuiet = mBlQuiet || mNPeace >= kPassesToPeace;
+    }
+
+    void Broken(const std::string& szPromise, const MappingKey& key) {
+        if (mSzBroken.empty()) {
+            const model::Router::Entry* pEntry = mRouter.At(key);
+            mSzBroken = szPromise + ": " + key.first + " " + std::to_string(key.second) + "\n    box " + mRouter.szBox +
+                        (pEntry == nullptr
+                             ? ", nothing there"
+                             : ", there " + pEntry->mapping.szClient + ":" + std::to_string(pEntry->mapping.nBoxPort) +
+                                   " '" + pEntry->mapping.szDescription + "'") +
+                        "\n" + mPRecord->Text();
+        }
+    }
+
+    // Nobody else's entry ever changes.
+    void CheckStrangers(const std::map<MappingKey, model::Router::Entry>& mapBefore) {
+        if (!mRouter.szBroken.empty()) {
+            mSzBroken = mRouter.szBroken;
+        }
+        for (const auto& [key, before] : mapBefore) {
+            const model::Router::Entry* pNow = mRouter.At(key);
+            if (!before.blBox &&
+                (pNow == nullptr || pNow->blBox || pNow->mapping.nBoxPort != before.mapping.nBoxPort)) {
+                Broken("a stranger's entry changed", key);
+            }
+        }
+    }
+
+    // What is said to be open is open; what may be left of ours is named.
+    void CheckWords(const tavo::PassResult& result, bool blTrouble) {
+        for (size_t i = 0; i < mRgWanted.size(); ++i) {
+            const MappingKey key = tavo::KeyOf(mRgWanted[i]);
+            const model::Router::Entry* pEntry = mRouter.At(key);
+            const bool blThere = pEntry != nullptr && pEntry->mapping.szClient == mRouter.szBox &&
+                                 pEntry->mapping.nBoxPort == mRgWanted[i].nBoxPort;
+            const tavo::Verdict& verdict = result.rgOutcomes.at(i).verdict;
+            if (verdict.szWord.empty() || verdict.szWord == "written") {
+                Broken("no verdict", key);
+            }
+            if (verdict.enState == tavo::PortState::kOpen && !blThere) {
+                Broken("said to be open and is not", key);
+            }
+            if (mBlQuiet && !blTrouble && verdict.blAnew && mSetOpen.contains(key) && !mRouter.habits.blForgetsLease) {
+                Broken("made anew where nothing had happened: closed until now", key);
+            }
+            if (verdict.enState == tavo::PortState::kOpen) {
+                mSetOpen.insert(key);
+            } else {
+                mSetOpen.erase(key);
+            }
+        }
+        std::set<MappingKey> setNamed;
+        for (const tavo::Outcome& outcome : result.rgOutcomes) {
+            setNamed.emplace(outcome.szProtocol, outcome.nRouterPort);
+        }
+        for (const auto& [key, entry] : mRouter.mMapTable) {
+            if (entry.blBox && mRouter.At(key) != nullptr && !setNamed.contains(key)) {
+                Broken("ours, wanted by no rule, and not named", key);
+            }
+        }
+    }
+
+    void CheckPeace(const tavo::PassResult& result) {
+        size_t nUsed = 0;
+        for (const auto& [key, entry] : mRouter.mMapTable) {
+            nUsed += mRouter.At(key) != nullptr ? 1 : 0;
+        }
+        for (size_t i = 0; i < mRgWanted.size(); ++i) {
+            const MappingKey key = tavo::KeyOf(mRgWanted[i]);
+            const model::Router::Entry* pEntry = mRouter.At(key);
+            const bool blFree = pEntry == nullptr ? nUsed < mRouter.habits.nCapacity
+                                                  : pEntry->blBox && (pEntry->mapping.szClient == mRouter.szBox ||
+                                                                      !mRouter.habits.blSecure);
+            if (blFree && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
+                Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
+            }
+        }
+        for (const auto& [key, entry] : mRouter.mMapTable) {
+            const bool blOurs = entry.blBox && mRouter.At(key) != nullptr;
+            const bool blWanted = std::any_of(mRgWanted.begin(), mRgWanted.end(),
+                                              [&](const RouterMapping& wanted) { return tavo::KeyOf(wanted) == key; });
+            if (blOurs && !blWanted && (!mRouter.habits.blSecure || entry.mapping.szClient == mRouter.szBox)) {
+                Broken("outlives its rule", key);
+            }
+        }
+    }
+
+    std::mt19937 mRandom;
+    int64_t mNNow = 1000000;
+    model::Router mRouter;
+    std::map<MappingKey, model::Router::Entry> mMapOther;
+    bool mBlOther = false;
+    std::vector<RouterMapping> mRgWanted;
+    std::set<MappingKey> mSetOpen;  // at the last look
+    std::string mSzDisk;
+    std::unique_ptr<tavo::Record> mPRecord;
+    tavo::LeaseHabit mHabit;
+    int mNBoots = 0;
+    int64_t mNBootAt = 0;
+    int64_t mNNext = 0;
+    int mNCheck = 120;
+    int mNPeace = 0;        // passes since the last trouble
+    bool mBlQuiet = false;  // nothing has happened since everything was as it is to be
+    std::deque<std::string> mStory;
+    std::string mSzBroken;
+};
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const unsigned nSeeds = argc > 1 ? static_cast<unsigned>(std::atoi(argv[1])) : 1000;
+    const unsigned nFirst = argc > 2 ? static_cast<unsigned>(std::atoi(argv[2])) : 1;
+    int nFailed = 0;
+    int64_t nSeconds = 0;
+    for (unsigned nSeed = nFirst; nSeed < nFirst + nSeeds && nFailed < 3; ++nSeed) {
+        Life life(nSeed);
+        const auto szBroken = life.Live();
+        nSeconds += life.Seconds();
+        if (szBroken) {
+            ++nFailed;
+            std::printf("seed %u: %s\n", nSeed, szBroken->c_str());
+            for (const std::string& szEvent : life.Story()) {
+                std::printf("    %s\n", szEvent.c_str());
+            }
+        }
+    }
+    std::printf("%u lives, %lld days: %s\n", nSeeds, static_cast<long long>(nSeconds / 86400),
+                nFailed == 0 ? "every promise was kept" : "BROKEN PROMISES");
+    return nFailed == 0 ? 0 : 1;
+}
