@@ -52,6 +52,53 @@ class World(unittest.TestCase):
                 self.setUp()
         LAB.start_router()
 
+    def test_a_router_that_restarts_and_says_so(self):
+        LAB.settings()  # two minutes between looks
+        LAB.start_router()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        LAB.stop_router()
+        self.assertEqual(LAB.mappings(), {})
+        LAB.start_router()
+        wait_for(lambda: LAB.reaches("tcp", 5001), 10, "it is open again")
+
+    def test_the_box_has_another_address_by_natpmp(self):
+        """A gateway knows a client by its address: the old mapping lasts until its lease ends, and is named till then."""
+        LAB.install(natpmp=True)
+        LAB.settings(check_interval=1, lease=20)
+        LAB.start_router()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")["status"], 0)
+        own_address(NEW, BOX)
+        published = "/run/tavo/natpmpd.json"
+        try:
+            wait_for(lambda: "former address" in LAB.read(published), 10, "what is waited for is said")
+            self.assertNotEqual(LAB.save("2,1,tcp,5002,5002")["result"], 0, "5001 is still open")
+            self.assertEqual([row["name"] for row in json.loads(LAB.read(published))["left_over"]], ["5001/tcp"])
+            wait_for(lambda: LAB.mappings() == {("tcp", 5002): (NEW, 5002)}, 40, "it leads to the new address")
+            LAB.stop_daemon(signal.SIGTERM)
+            self.assertEqual(LAB.mappings(), {})
+        finally:
+            own_address(BOX, NEW)
+
+    def test_a_change_of_the_network_is_noticed_at_once(self):
+        LAB.settings()  # two minutes between looks
+        LAB.start_router(secure=False)
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        own_address(NEW, BOX)
+        try:
+            wait_for(lambda: LAB.mappings() == {("tcp", 5001): (NEW, 5001)}, 8, "it leads to the new address")
+        finally:
+            own_address(BOX, NEW)
+        wait_for(lambda: LAB.mappings() == {("tcp", 5001): (BOX, 5001)}, 12, "and back")
+        for down, up, word in (("ip -n box route del default", f"ip -n box route add default via {GATEWAY}", "no_gateway"),
+                               ("ip -n router link set box1 down", "ip -n router link set box1 up", "unreachable")):
+            sh(down)
+            try:
+                wait_for(lambda: json.loads(LAB.read(PUBLISHED))["router"] == word, 20, word)
+            finally:
+                sh(up)
+            wait_for(lambda: json.loads(LAB.read(PUBLISHED))["router"] == "ok", 20, "and back")
+        self.assertTrue(LAB.reaches("tcp", 5001))
+
     def test_rules_go_with_the_old_address_gone(self):
         LAB.start_router(secure=False)
         self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)

@@ -9,6 +9,7 @@
 #include "daemons/common/TestMappings.h"
 #include "mapping/Carry.h"
 #include "upnp/Igd.h"
+#include "upnp/Notify.h"
 #include "upnp/Ssdp.h"
 
 namespace {
@@ -161,6 +162,21 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
     std::vector<RouterMapping> rgMappings;
     EXPECT_NE(tavo::Igd::At({"192.168.1.1", 80, "/"}, pFirst)->ListRange("TCP", 1, 9, rgMappings), 0);
     EXPECT_EQ(pFirst->mNPosts, 0);
+}
+
+TEST(Notify, ALifeIsANumberOrAPlace) {
+    const std::pair<const char*, const char*> rgCases[] = {
+        {"NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nLocation: http://192.168.1.1:5000/\r\nBOOTID.UPNP.ORG: 7\r\n\r\n",
+         "7"},
+        {"NOTIFY * HTTP/1.1\r\nnts:ssdp:alive\r\nLOCATION:http://192.168.1.1:5000/\r\n\r\n",
+         "http://192.168.1.1:5000/"},
+        {"NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nBOOTID.UPNP.ORG: 7\r\n\r\n", ""},
+        {"HTTP/1.1 200 OK\r\nNTS: ssdp:alive\r\nBOOTID.UPNP.ORG: 7\r\n\r\n", ""},
+        {"NOTIFY", ""},
+        {"", ""}};
+    for (const auto& [szMessage, szLife] : rgCases) {
+        EXPECT_EQ(tavo::LifeOf(szMessage), szLife) << szMessage;
+    }
 }
 
 class MemoryRouter : public tavo::Router {
@@ -403,11 +419,16 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     tavo::Record same(szText, "one");
     same.TurnTo({"10.0.0.1", "aa:bb"});  // the same device has another address
     ASSERT_EQ(same.Here().size(), 1U);
-    const tavo::Made& made = same.Here()[{"TCP", 1}];
+    tavo::Made& made = same.Here()[{"TCP", 1}];
     EXPECT_EQ(made.szText, "\"odd\n]text");
-    EXPECT_TRUE(made.IsEntry(Entry(1, 11, kBox, "any")));
-    EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "any")));
-    EXPECT_FALSE(made.IsEntry(Entry(1, 11, "192.168.1.9", "\"odd\n]text")));
+    for (const bool blShown : {true, false}) {  // until it is shown, what it leads to will do, or its text
+        made.blShown = blShown;
+        EXPECT_TRUE(made.IsEntry(Entry(1, 11, kBox, "\"odd\n]text")));
+        EXPECT_EQ(made.IsEntry(Entry(1, 11, kBox, "any")), !blShown);
+        EXPECT_EQ(made.IsEntry(Entry(1, 12, kBox, "\"odd\n]text")), !blShown);
+        EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "any")));
+        EXPECT_FALSE(made.IsEntry(Entry(1, 11, "192.168.1.9", "\"odd\n]text")));
+    }
     EXPECT_EQ(std::make_tuple(made.IsDue(5049), made.IsDue(5050), made.End()), std::make_tuple(false, true, 5100));
 
     tavo::Record later(szText, "two");

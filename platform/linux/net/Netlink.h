@@ -1,6 +1,7 @@
 // The kernel's tables over netlink, with their owners. Relies on libnl-3. Promises: nothing is left open.
 #pragma once
 
+#include <netlink/cache.h>
 #include <netlink/netlink.h>
 
 #include <memory>

@@ -25,7 +25,6 @@ constexpr size_t kMaxText = 256;
 constexpr int kMaxDepth = 12;
 constexpr int kLeastErrorCode = 100;  // no protocol has less, and as a status "1" is success
 constexpr int kMaxEntries = 65536;
-constexpr size_t kRangeEntries = 64;                  // of one answer
 constexpr auto kListLimit = std::chrono::seconds(8);  // then who asks goes on by name
 constexpr char kEncoding[] = "http://schemas.xmlsoap.org/soap/encoding/";
 constexpr char kEnvelope[] = "http://schemas.xmlsoap.org/soap/envelope/";

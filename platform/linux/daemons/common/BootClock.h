@@ -4,6 +4,8 @@
 
 #include <chrono>
 #include <ctime>
+#include <fstream>
+#include <string>
 
 namespace tavo {
 
@@ -20,5 +22,13 @@ struct BootClock {
         return time_point(std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec));
     }
 };
+
+// What tells this boot from every other one, whose times mean nothing here.
+inline std::string BootId() {
+    std::ifstream file("/proc/sys/kernel/random/boot_id");
+    std::string szId;
+    std::getline(file, szId);
+    return szId;
+}
 
 }  // namespace tavo

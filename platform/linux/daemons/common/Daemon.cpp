@@ -19,6 +19,7 @@
 #include <cstring>
 #include <iterator>
 #include <string_view>
+#include <utility>
 
 #include "core/Descriptor.h"
 #include "core/OwnFile.h"
@@ -27,6 +28,7 @@
 #include "daemons/common/Instance.h"
 #include "daemons/common/SignalQueue.h"
 #include "daemons/common/Watch.h"
+#include "net/NetworkWatch.h"
 #include "tavo/core.h"
 
 namespace tavo {
@@ -60,6 +62,8 @@ constexpr const char* kLockFiles[] = {kRouterLock, "/tmp/upnp_detector.lock", "/
 constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
 constexpr auto kEndLimit = std::chrono::seconds(20);   // for another instance: a pass, and the mappings
+constexpr auto kSettle = std::chrono::seconds(1);      // an address rarely changes alone
+constexpr auto kLeastPause = std::chrono::seconds(5);  // between passes that others than we can cause
 constexpr auto kStartLimit = std::chrono::seconds(5);  // of an instance that somebody else starts
 constexpr int kPollMilliseconds = 20;
 
@@ -178,26 +182,35 @@ private:
     Mapper& mMapper;
     SignalQueue mSignals;
     Descriptor mFdEvents;
+    NetworkWatch mNetwork;
     bool mBlRequested = true;  // the start counts as a request
     int mNCut = 0;             // passes in a row that a newer request may have ended early
     Clock::time_point mNext = Clock::now();
+    bool mBlWoken = false;     // mNext is so early because of a wake
+    Clock::time_point mWoken;  // when the last pass of that kind began
 };
 
 // Until the clock, a signal, a new file in the marker's directory or a word from the router.
 void Frame::Wait() {
     const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mNext - Clock::now()).count() + 1;
-    pollfd rgWaiting[] = {mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}};
+    pollfd rgWaiting[] = {
+        mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}, {mNetwork.Fd(), POLLIN, 0}};
     mSignals.Wait(rgWaiting, static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
     alignas(inotify_event) char szEvents[4096];
     while (read(mFdEvents.Get(), szEvents, sizeof(szEvents)) > 0) {
     }
-    if (rgWaiting[2].revents != 0 && mMapper.OnWake()) {
-        mNext = Clock::now();
+    const bool blRouter = rgWaiting[2].revents != 0 && mMapper.OnWake();
+    const bool blNetwork = rgWaiting[3].revents != 0 && mNetwork.TakeChange() && mMapper.OnNetworkChange();
+    const auto early = std::max(Clock::now() + kSettle, mWoken + kLeastPause);
+    if ((blRouter || blNetwork) && early < mNext) {
+        mNext = early;
+        mBlWoken = true;
     }
 }
 
 void Frame::RunPass() {
     WritePidFile(mNames);
+    mWoken = std::exchange(mBlWoken, false) ? Clock::now() : mWoken;
     // A stop or a newer request ends a pass early: what it would report is out of date. But requests
     // without end must not keep the router from ever being brought in line.
     const bool blWhole = mNCut >= kCutPasses;

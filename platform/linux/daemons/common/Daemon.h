@@ -35,6 +35,8 @@ public:
     // what it said is a reason for a pass now.
     virtual int WakeFd() const { return -1; }
     virtual bool OnWake() { return false; }
+    // Whether what has changed of this box's network is a reason for a pass.
+    virtual bool OnNetworkChange() = 0;
 };
 
 // A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM, SIGINT or

@@ -4,22 +4,14 @@
 #include <sys/stat.h>
 #include <syslog.h>
 
-#include <fstream>
-
 #include "core/TextFile.h"
+#include "daemons/common/BootClock.h"
 
 namespace tavo {
 
 namespace {
 
 constexpr char kStateDir[] = "/var/lib/tavo";
-
-std::string BootId() {
-    std::ifstream file("/proc/sys/kernel/random/boot_id");
-    std::string szId;
-    std::getline(file, szId);
-    return szId;
-}
 
 }  // namespace
 

@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
+#include <utility>
 
 #include "core/TextFile.h"
 #include "net/Neighbour.h"
@@ -33,6 +34,18 @@ int Setting(const char* szSection, const char* szKey, const char* szDefault, int
     char szValue[16];
     TLIBPlatformSettingGet(szSection, szKey, szDefault, szValue, sizeof(szValue));
     return static_cast<int>(std::clamp<long>(std::strtol(szValue, nullptr, 10), nLeast, nMost));
+}
+
+// The gateway, the address that faces it, and whether the link is up: nothing else of the network concerns us, and a
+// box with containers has much else.
+std::string NetworkInSight() {
+    char szGateway[kAddressSize] = {};
+    char szBox[kAddressSize] = {};
+    char szInterface[kAddressSize] = {};
+    const bool blGateway = TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) == 0 &&
+                           TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) == 0;
+    const bool blLink = checkGwIfEnable(szInterface, sizeof(szInterface)) == 0;
+    return std::string(blGateway ? szGateway : "") + " " + (blGateway ? szBox : "") + (blLink ? " up" : " down");
 }
 
 }  // namespace
@@ -94,6 +107,11 @@ bool RuleMapper::TakeTurn(const std::function<bool()>& fnStop) {
     return mTurn.Take([&] { return IsSwitchedOn() && !fnStop() && BootClock::now() < end; });
 }
 
+bool RuleMapper::OnNetworkChange() {
+    std::string szNow = NetworkInSight();
+    return std::exchange(mSzNetwork, szNow) != szNow;
+}
+
 PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter) {
     const PortState enState = enRouter == RouterState::kBusy ? PortState::kWaiting : PortState::kUnknown;
     PassResult result;
@@ -133,6 +151,7 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
 
 int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
     blRequested = MendRunKeys() || blRequested;
+    mSzNetwork = NetworkInSight();
     if (blRequested) {
         ReadSettings();
         ReadRules();
@@ -190,7 +209,9 @@ void RuleMapper::WriteResults(const OutcomeList& rgOutcomes) const {
     if (!mWanted.blReadable) {
         rgAll.push_back({"rule.conf", {PortState::kUnknown, "unreadable"}});
     }
-    if (!WriteFileAtomic(mNames.szResultFile, ResultText(rgAll), kResultMode)) {
+    const std::string szText = ResultText(rgAll);
+    // A box that has nothing to do lets its disks sleep.
+    if (ReadFile(mNames.szResultFile) != szText && !WriteFileAtomic(mNames.szResultFile, szText, kResultMode)) {
         syslog(LOG_ERR, "cannot write %s", mNames.szResultFile);
     }
 }

@@ -28,6 +28,7 @@ public:
     int Run(bool blRequested, const std::function<bool()>& fnStop) final;
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
     bool Withdraw(const std::function<bool()>& fnStop) final;
+    bool OnNetworkChange() final;
 
 protected:
     // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked
@@ -75,6 +76,7 @@ private:
     WantedSet mWanted;
     bool mBlRulesRead = false;
     bool mBlMended = false;  // no killed save or detection has left our run key off
+    std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
     RouterTurn mTurn;
     std::string mSzGateway;
     std::string mSzBox;

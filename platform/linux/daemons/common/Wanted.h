@@ -8,8 +8,8 @@
 #include <vector>
 
 #include "mapping/Outcome.h"
-#include "tavo/portforward.h"
 #include "mapping/Router.h"
+#include "tavo/portforward.h"
 
 namespace tavo {
 

@@ -9,6 +9,8 @@
 #include <vector>
 
 #include "core/TextFile.h"
+#include "daemons/common/BootClock.h"
+#include "mapping/Pass.h"
 
 namespace tavo {
 
@@ -16,6 +18,7 @@ namespace {
 
 constexpr char kStateDir[] = "/var/lib/tavo";
 constexpr char kStateFile[] = "/var/lib/tavo/natpmp_held.conf";
+constexpr char kBootSection[] = "boot";
 constexpr long kMaxPort = 65535;
 
 std::string SectionName(const HeldKey& key) {
@@ -30,29 +33,36 @@ long Number(const std::string& szText) {
 
 void HeldMappings::Load() {
     mSzWritten = ReadFile(kStateFile).value_or("");
+    bool blThisBoot = false;
     for (const Section& section : ParseSections(mSzWritten).value_or(std::vector<Section>())) {
         std::map<std::string, std::string> mapValues;
         for (const Pair& pair : section.rgPairs) {
             mapValues[pair.szKey] = pair.szValue;
         }
+        blThisBoot = blThisBoot || (section.szName == kBootSection && mapValues["id"] == BootId());
         const std::string& szProtocol = mapValues["protocol"];
         const long nBoxPort = Number(mapValues["box_port"]);
         const long nRouterPort = Number(mapValues["router_port"]);
         if ((szProtocol == "TCP" || szProtocol == "UDP") && nBoxPort >= 1 && nBoxPort <= kMaxPort && nRouterPort >= 1 &&
             nRouterPort <= kMaxPort) {
             mRows[HeldKey{mapValues["gateway"], mapValues["box"], szProtocol, static_cast<uint16_t>(nBoxPort)}] =
-                Held{static_cast<uint16_t>(nRouterPort), 0, Number(mapValues["expiry"])};
+                Held{static_cast<uint16_t>(nRouterPort), 0,
+                     blThisBoot ? Number(mapValues["expiry"]) : BootSeconds() + Number(mapValues["lease"]),
+                     static_cast<uint32_t>(Number(mapValues["lease"]))};
         }
     }
 }
 
 void HeldMappings::Prune() {
-    const time_t now = std::time(nullptr);
+    const int64_t now = BootSeconds();
     std::erase_if(mRows, [now](const auto& row) { return row.second.nExpiry < now; });
 }
 
 void HeldMappings::Save() {
     std::vector<Section> rgSections;
+    if (!mRows.empty()) {
+        rgSections.push_back({kBootSection, {{"id", BootId()}}});
+    }
     for (const auto& [key, held] : mRows) {
         rgSections.push_back({SectionName(key),
                               {{"gateway", key.szGateway},
@@ -60,7 +70,8 @@ void HeldMappings::Save() {
                                {"protocol", key.szProtocol},
                                {"box_port", std::to_string(key.nBoxPort)},
                                {"router_port", std::to_string(held.nRouterPort)},
-                               {"expiry", std::to_string(held.nExpiry)}}});
+                               {"expiry", std::to_string(held.nExpiry)},
+                               {"lease", std::to_string(held.nLease)}}});
     }
     std::string szText = FormatSections(rgSections);
     if (szText == mSzWritten) {

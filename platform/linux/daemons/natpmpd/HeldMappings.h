@@ -4,7 +4,6 @@
 #pragma once
 
 #include <cstdint>
-#include <ctime>
 #include <map>
 #include <string>
 #include <tuple>
@@ -27,7 +26,8 @@ struct HeldKey {
 struct Held {
     uint16_t nRouterPort = 0;
     uint32_t nLifetime = 0;  // seconds granted; 0: asked for, but whether it is there is not known
-    time_t nExpiry = 0;      // the box's own time of day
+    int64_t nExpiry = 0;     // seconds of boot time
+    uint32_t nLease = 0;     // seconds asked for or granted: it ends so long after the next boot at the latest
 };
 
 class HeldMappings {

@@ -16,6 +16,8 @@ namespace {
 // would be answered with the first, and giving that back would end it.
 constexpr char kShared[] = "another rule has this port of the box; NAT-PMP gives it one router port only";
 
+constexpr int kYoungAgain = 10;  // seconds until a gateway that has just started is asked once more
+
 RouterState StateOf(int nTransport) {
     switch (nTransport) {
         case kRouterOk:
@@ -31,9 +33,12 @@ Verdict Refusal(int nCode, std::string szWords) {
     return {nCode < 0 ? PortState::kUnknown : PortState::kRefused, std::move(szWords)};
 }
 
+uint32_t SecondsLeft(const Held& held) {
+    return static_cast<uint32_t>(std::clamp<int64_t>(held.nExpiry - BootSeconds(), 1, UINT32_MAX));
+}
+
 Verdict Open(const Held& held) {
-    const time_t nLeft = held.nExpiry - std::time(nullptr);
-    return {PortState::kOpen, "1", {}, static_cast<uint32_t>(std::clamp<time_t>(nLeft, 1, UINT32_MAX))};
+    return {PortState::kOpen, "1", {}, SecondsLeft(held)};
 }
 
 }  // namespace
@@ -57,6 +62,43 @@ std::vector<HeldKey> NatpmpPass::HeldHere() const {
     return rgKeys;
 }
 
+// The router's port as this box has it still by an address that it had before. A gateway knows a client by its address:
+// only the end of the lease takes that away.
+std::optional<HeldKey> NatpmpPass::FormerOf(const RouterMapping& wanted) const {
+    for (const auto& [key, held] : mState.held.mRows) {
+        if (key.szGateway == mSzGateway && key.szBox != mSzBox && key.szProtocol == wanted.szProtocol &&
+            held.nRouterPort == wanted.nRouterPort) {
+            return key;
+        }
+    }
+    return std::nullopt;
+}
+
+Verdict NatpmpPass::HeldFor(const HeldKey& former) {
+    const uint32_t nLeft = SecondsLeft(mState.held.mRows.at(former));
+    const int nNext = static_cast<int>(std::min<uint32_t>(nLeft + 1, INT32_MAX));
+    mResult.nNextSeconds = mResult.nNextSeconds == 0 ? nNext : std::min(mResult.nNextSeconds, nNext);
+    Verdict verdict{PortState::kWaiting, "the router keeps it for this box's former address " + former.szBox};
+    verdict.nLease = nLeft;
+    return verdict;
+}
+
+// What leads to an address that the box had before, and no rule asks for.
+void NatpmpPass::ReportFormer() {
+    for (const auto& [key, held] : mState.held.mRows) {
+        const bool blWanted =
+            std::any_of(mMapWanted.begin(), mMapWanted.end(), [&, &former = key, &row = held](const auto& wanted) {
+                return wanted.second->nRouterPort == row.nRouterPort && wanted.first.szProtocol == former.szProtocol;
+            });
+        if (key.szGateway == mSzGateway && key.szBox != mSzBox && !blWanted) {
+            Outcome outcome =
+                OutcomeOf({key.szProtocol, held.nRouterPort, key.nBoxPort, key.szBox, "", 0, true}, HeldFor(key));
+            outcome.blLeftOver = true;
+            mRgOpen.push_back(std::move(outcome));
+        }
+    }
+}
+
 bool NatpmpPass::IsWanted(const HeldKey& key) const {
     const auto it = mMapWanted.find(key);
     return it != mMapWanted.end() && it->second->nRouterPort == mState.held.mRows.at(key).nRouterPort;
@@ -76,7 +118,10 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
         mMapWanted.emplace(KeyOf(wanted), &wanted);  // the first rule that asks for a port of the box has it
     }
     mState.held.Prune();
-    if (rgWanted.empty() && HeldHere().empty()) {
+    const bool blHeld = std::any_of(mState.held.mRows.begin(), mState.held.mRows.end(),
+                                    [this](const auto& row) { return row.first.szGateway == mSzGateway; });
+    if (rgWanted.empty() && !blHeld) {
+        mState.held.Save();
         return mResult;
     }
     // One question that changes nothing tells whether the gateway answers, and whether it has restarted.
@@ -85,8 +130,12 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
     mBlLost = blRestarted;
     if (blRestarted) {
         syslog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
+        std::erase_if(mState.held.mRows, [this](const auto& row) {
+            return row.first.szGateway == mSzGateway && row.first.szBox != mSzBox;
+        });
     }
-    if (blRenew || blRestarted || mState.blSilent) {
+    ReportFormer();
+    if (blRenew || blRestarted || mState.blDoubtful) {
         Doubt();
     }
     mResult.nTransport = std::min(nCode, int{kRouterOk});
@@ -100,7 +149,11 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
         PlaceAll(rgWanted);
     }
     mState.held.Save();
-    mState.blSilent = mResult.nTransport != kRouterOk;
+    const bool blYoung = mResult.nTransport == kRouterOk && mState.epoch.IsYoung();
+    mState.blDoubtful = mResult.nTransport != kRouterOk || blYoung;
+    if (blYoung && !mMapWanted.empty()) {
+        mResult.nNextSeconds = kYoungAgain;
+    }
     NoteLease();
     mResult.rgOutcomes.insert(mResult.rgOutcomes.end(), mRgOpen.begin(), mRgOpen.end());
     mResult.enRouter = StateOf(mResult.nTransport);
@@ -109,9 +162,8 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
 
 void NatpmpPass::ReportOpen(const HeldKey& key, int nCode) {
     const RouterMapping mapping{key.szProtocol, mState.held.mRows.at(key).nRouterPort, key.nBoxPort, "", "", 0, true};
-    const time_t nLeft = mState.held.mRows.at(key).nExpiry - std::time(nullptr);
     Outcome outcome = OutcomeOf(mapping, Refusal(nCode, "still open: " + NatpmpWords(nCode)));
-    outcome.verdict.nLease = static_cast<uint32_t>(std::clamp<time_t>(nLeft, 0, UINT32_MAX));
+    outcome.verdict.nLease = SecondsLeft(mState.held.mRows.at(key));
     outcome.blLeftOver = true;
     mRgOpen.push_back(std::move(outcome));
 }
@@ -135,7 +187,7 @@ void NatpmpPass::RemoveUnwanted() {
 void NatpmpPass::NoteIntents() {
     for (const auto& [key, pWanted] : mMapWanted) {
         if (mState.mapRemapped.count(MappingName(*pWanted)) == 0) {
-            const Held intent{pWanted->nRouterPort, 0, std::time(nullptr) + mNWishedLease};
+            const Held intent{pWanted->nRouterPort, 0, BootSeconds() + mNWishedLease, mNWishedLease};
             if (mState.held.mRows.emplace(key, intent).second) {
                 mSetNew.insert(key);
             }
@@ -156,6 +208,9 @@ void NatpmpPass::PlaceAll(const std::vector<RouterMapping>& rgWanted) {
 }
 
 Verdict NatpmpPass::Place(const RouterMapping& wanted) {
+    if (const auto former = FormerOf(wanted)) {
+        return HeldFor(*former);
+    }
     const auto remapped = mState.mapRemapped.find(MappingName(wanted));
     if (remapped != mState.mapRemapped.end()) {
         return {PortState::kRefused, remapped->second};
@@ -172,10 +227,10 @@ Verdict NatpmpPass::Ask(const RouterMapping& wanted, Held& held) {
     const int nCode =
         mGuard.Note(mClient.Map(wanted.szProtocol, wanted.nBoxPort, wanted.nRouterPort, mNWishedLease, grant));
     if (nCode != kRouterOk) {
-        held = {wanted.nRouterPort, 0, std::max(held.nExpiry, std::time(nullptr) + time_t{mNWishedLease})};
+        held = {wanted.nRouterPort, 0, std::max(held.nExpiry, BootSeconds() + mNWishedLease), mNWishedLease};
         return Refusal(nCode, NatpmpWords(nCode));
     }
-    held = {grant.nRouterPort, grant.nLifetime, std::time(nullptr) + time_t{grant.nLifetime}};
+    held = {grant.nRouterPort, grant.nLifetime, BootSeconds() + grant.nLifetime, grant.nLifetime};
     if (grant.nRouterPort != wanted.nRouterPort) {
         return HandBack(wanted);
     }

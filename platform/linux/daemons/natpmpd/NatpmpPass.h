@@ -5,13 +5,14 @@
 
 #include <functional>
 #include <map>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
 
-#include "mapping/Pass.h"
 #include "daemons/natpmpd/EpochWatch.h"
 #include "daemons/natpmpd/HeldMappings.h"
+#include "mapping/Pass.h"
 #include "natpmp/NatpmpClient.h"
 
 namespace tavo {
@@ -20,7 +21,7 @@ namespace tavo {
 struct NatpmpState {
     HeldMappings held;
     EpochWatch epoch;
-    bool blSilent = false;  // it did not answer the last time, and may have been restarting
+    bool blDoubtful = false;  // it did not answer the last time, or had just started: it may have begun anew since
     // Mapping names, each with what the gateway offered instead. They are asked for again when leases are
     // renewed and not at each check, because each asking opens a wrong port for a moment.
     std::map<std::string, std::string> mapRemapped;
@@ -38,6 +39,9 @@ private:
         return {mSzGateway, mSzBox, mapping.szProtocol, mapping.nBoxPort};
     }
     std::vector<HeldKey> HeldHere() const;
+    std::optional<HeldKey> FormerOf(const RouterMapping& wanted) const;
+    Verdict HeldFor(const HeldKey& former);
+    void ReportFormer();
     bool IsWanted(const HeldKey& key) const;
     void Doubt();
     void RemoveUnwanted();

@@ -22,6 +22,7 @@ constexpr int kOutsideMilliseconds = 2000;
 UpnpMapper::UpnpMapper() : RuleMapper(kNames, false), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
+    mAnnouncements.Listen(Box());
     mPIgd.reset();
     KnownRouter known = RecallRouter(Gateway());
     mSzLocation = std::move(known.szLocation);
@@ -50,13 +51,13 @@ void UpnpMapper::Remember() const {
 }
 
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
-    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});
-    mMade.Get().Prune(BootSeconds());
     if (!FindRouter(fnStop)) {
         PassResult result = Failed(rgWanted, "noigd", RouterState::kNoService);
         result.blStopped = fnStop();
         return result;
     }
+    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});  // it has spoken by now, so that the kernel knows it
+    mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     const bool blPermanentOnly = mHabit.blPermanentOnly;

@@ -1,0 +1,41 @@
+// See NetworkWatch.h.
+#include "net/NetworkWatch.h"
+
+#include <linux/rtnetlink.h>
+#include <netlink/socket.h>
+#include <sys/socket.h>
+#include <syslog.h>
+
+#include <cerrno>
+
+namespace tavo {
+
+namespace {
+
+constexpr int kMessageSize = 16384;
+
+}  // namespace
+
+NetworkWatch::NetworkWatch() : mPSocket(Connect()) {
+    if (mPSocket && nl_socket_add_memberships(mPSocket.get(), RTNLGRP_LINK, RTNLGRP_IPV4_IFADDR, RTNLGRP_IPV4_ROUTE,
+                                              RTNLGRP_NONE) < 0) {
+        mPSocket.reset();
+    }
+    if (!mPSocket) {
+        syslog(LOG_WARNING, "a change of the network is noticed at the next check only");
+    }
+}
+
+bool NetworkWatch::TakeChange() {
+    bool blChange = false;
+    char szMessage[kMessageSize];
+    for (;;) {
+        const ssize_t nRead = recv(Fd(), szMessage, sizeof(szMessage), MSG_DONTWAIT);
+        if (nRead < 0 && errno != ENOBUFS && errno != EINTR) {
+            return blChange;
+        }
+        blChange = true;
+    }
+}
+
+}  // namespace tavo

@@ -1,0 +1,31 @@
+// What a router says of its own accord by SSDP: that it has begun anew. Relies on one multicast UDP socket.
+// Promises: never waits; only what comes from the gateway's address counts, and it is a hint, no more.
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "core/Descriptor.h"
+#include "core/Export.h"
+
+namespace tavo {
+
+// What tells one life of a device from the next, in an announcement that it is there; empty for anything else. In the
+// second generation that is a number, before that the place of its description.
+TAVO_PLATFORM_API std::string LifeOf(std::string_view szMessage);
+
+class TAVO_PLATFORM_API Announcements {
+public:
+    // Listens on the network of the box's address szLocal, and forgets what was heard before.
+    void Listen(const std::string& szLocal);
+    // Readable when something was said; -1 while nobody listens.
+    int Fd() const { return mFd.Get(); }
+    // Takes in what was said. True when the gateway is heard for the first time, or has another life.
+    bool TakeNews(const std::string& szGateway);
+
+private:
+    Descriptor mFd;
+    std::string mSzLife;
+};
+
+}  // namespace tavo
