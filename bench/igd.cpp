@@ -7,8 +7,9 @@
 #include <string_view>
 #include <vector>
 
-#include "mapping/Carry.h"
+#include "core/TextFile.h"
 #include "daemons/common/Wanted.h"
+#include "mapping/Carry.h"
 #include "tavo/net.h"
 #include "upnp/Igd.h"
 
@@ -24,6 +25,7 @@ constexpr char kHelp[] =
     "  map N     make the tool's mappings TCP 20000 and up, N of them (1 to 1000), the only ones of the tool\n"
     "  unmap     take the tool's mappings away\n";
 
+constexpr char kRecord[] = "/tmp/tavo-igd.conf";
 constexpr std::string_view kBenchPrefix = "tavobench:";
 constexpr std::string_view kForeignPrefix = "rule's:";
 
@@ -103,9 +105,12 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
     }
     tavo::LeaseHabit habit;
     BenchRouter router(igd);
-    tavo::Record record("", "bench");
-    const tavo::PassResult result =
-        tavo::BringInLine(router, rgWanted, record, habit, {szBox, tavo::BootSeconds, [] { return false; }, [] {}});
+    // As upnpd remembers what it made.
+    tavo::Record record(tavo::ReadFile(kRecord).value_or(""), "bench");
+    record.TurnTo({"the gateway", ""});
+    const tavo::PassResult result = tavo::BringInLine(
+        router, rgWanted, record, habit,
+        {szBox, tavo::BootSeconds, [] { return false; }, [&record] { tavo::WriteFileAtomic(kRecord, record.Text()); }});
     int nMissing = 0;
     for (const tavo::Outcome& outcome : result.rgOutcomes) {
         if (outcome.verdict.szWord != "1") {

@@ -165,15 +165,15 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
 }
 
 TEST(Notify, ALifeIsANumberOrAPlace) {
-    const std::pair<const char*, const char*> rgCases[] = {
+    const std::pair<const char*, std::optional<std::string>> rgCases[] = {
         {"NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nLocation: http://192.168.1.1:5000/\r\nBOOTID.UPNP.ORG: 7\r\n\r\n",
          "7"},
         {"NOTIFY * HTTP/1.1\r\nnts:ssdp:alive\r\nLOCATION:http://192.168.1.1:5000/\r\n\r\n",
          "http://192.168.1.1:5000/"},
         {"NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nBOOTID.UPNP.ORG: 7\r\n\r\n", ""},
-        {"HTTP/1.1 200 OK\r\nNTS: ssdp:alive\r\nBOOTID.UPNP.ORG: 7\r\n\r\n", ""},
-        {"NOTIFY", ""},
-        {"", ""}};
+        {"HTTP/1.1 200 OK\r\nNTS: ssdp:alive\r\nBOOTID.UPNP.ORG: 7\r\n\r\n", std::nullopt},
+        {"NOTIFY", std::nullopt},
+        {"", std::nullopt}};
     for (const auto& [szMessage, szLife] : rgCases) {
         EXPECT_EQ(tavo::LifeOf(szMessage), szLife) << szMessage;
     }

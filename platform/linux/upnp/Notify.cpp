@@ -34,9 +34,10 @@ std::string_view Header(std::string_view szMessage, std::string_view szName) {
 
 }  // namespace
 
-std::string LifeOf(std::string_view szMessage) {
-    if (!szMessage.starts_with("NOTIFY ") || Header(szMessage, "NTS:") != "ssdp:alive") {
-        return "";
+std::optional<std::string> LifeOf(std::string_view szMessage) {
+    const std::string_view szKind = szMessage.starts_with("NOTIFY ") ? Header(szMessage, "NTS:") : "";
+    if (szKind != "ssdp:alive") {
+        return szKind == "ssdp:byebye" ? std::optional<std::string>("") : std::nullopt;
     }
     const std::string_view szBoot = Header(szMessage, "BOOTID.UPNP.ORG:");
     return PrintableText(szBoot.empty() ? Header(szMessage, "LOCATION:") : szBoot, kMaxLife);
@@ -76,11 +77,10 @@ bool Announcements::TakeNews(const std::string& szGateway) {
         }
         char szSender[INET_ADDRSTRLEN] = {};
         inet_ntop(AF_INET, &sender.sin_addr, szSender, sizeof(szSender));
-        const std::string szLife =
-            szGateway == szSender ? LifeOf({szMessage, static_cast<size_t>(nRead)}) : std::string();
-        if (!szLife.empty() && szLife != mSzLife) {
-            mSzLife = szLife;
-            blNews = true;
+        const auto szLife = LifeOf({szMessage, static_cast<size_t>(nRead)});
+        if (szGateway == szSender && szLife) {
+            blNews = blNews || (!szLife->empty() && *szLife != mSzLife);
+            mSzLife = *szLife;
         }
     }
     return blNews;

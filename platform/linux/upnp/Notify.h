@@ -2,6 +2,7 @@
 // Promises: never waits; only what comes from the gateway's address counts, and it is a hint, no more.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -10,9 +11,9 @@
 
 namespace tavo {
 
-// What tells one life of a device from the next, in an announcement that it is there; empty for anything else. In the
-// second generation that is a number, before that the place of its description.
-TAVO_PLATFORM_API std::string LifeOf(std::string_view szMessage);
+// What tells one life of a device from the next, in an announcement that it is there: in the second generation a
+// number, before that the place of its description. Empty when it says that it goes; nothing for anything else.
+TAVO_PLATFORM_API std::optional<std::string> LifeOf(std::string_view szMessage);
 
 class TAVO_PLATFORM_API Announcements {
 public:
@@ -20,7 +21,7 @@ public:
     void Listen(const std::string& szLocal);
     // Readable when something was said; -1 while nobody listens.
     int Fd() const { return mFd.Get(); }
-    // Takes in what was said. True when the gateway is heard for the first time, or has another life.
+    // Takes in what was said. True when the gateway is heard for the first time, after a goodbye, or has another life.
     bool TakeNews(const std::string& szGateway);
 
 private:
