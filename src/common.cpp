@@ -36,6 +36,8 @@ constexpr size_t kModelSize = 512;
 constexpr size_t kVersionSize = 1024;
 constexpr size_t kPathSize = 4096;
 constexpr size_t kToolLineSize = 1024;
+constexpr size_t kSuffixSize = 6;
+constexpr int kNameTries = 1000;  // one name in eleven is taken
 constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
 constexpr std::string_view kVersionKey = "syntax version";
 
@@ -97,6 +99,26 @@ void KeepOwnerAndMode(const char* szOld, const char* szNew) {
     if (blSameOwner || chown(szNew, status.st_uid, status.st_gid) == 0) {
         chmod(szNew, status.st_mode & 07777U);
     }
+}
+
+enum class Kind { kSmall, kCapital, kDigit, kOther };
+
+Kind KindOf(char c) {
+    return c >= 'a' && c <= 'z'   ? Kind::kSmall
+           : c >= 'A' && c <= 'Z' ? Kind::kCapital
+           : c >= '0' && c <= '9' ? Kind::kDigit
+                                  : Kind::kOther;
+}
+
+// Whether the end of the name is none that a person gives to a copy: among its six characters no two neighbours
+// are of one kind. By that the platform knows what a killed writer left.
+bool IsUnmistakable(std::string_view szName) {
+    if (szName.size() < kSuffixSize) {
+        return false;
+    }
+    const std::string_view szSuffix = szName.substr(szName.size() - kSuffixSize);
+    return std::adjacent_find(szSuffix.begin(), szSuffix.end(),
+                              [](char c, char d) { return KindOf(c) == KindOf(d); }) == szSuffix.end();
 }
 
 struct RecordFields {
@@ -344,12 +366,16 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
 }
 
 std::string UniqueName(const char* szPath) {
-    std::string szName = std::string(szPath) + "XXXXXX";
-    // The name is only ever renamed to, never opened, and its directory is root's own.
+    const std::string szTemplate = std::string(szPath) + "XXXXXX";
+    std::string szName;
+    for (int i = 0; i < kNameTries && !IsUnmistakable(szName); ++i) {
+        szName = szTemplate;
+        // The name is only ever renamed to, never opened, and its directory is root's own.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
-    mktemp(szName.data());
+        mktemp(szName.data());
 #pragma GCC diagnostic pop
+    }
     return szName;
 }
 

@@ -159,7 +159,8 @@ bool FillText(char (&szField)[N], const std::string& szText) {
 ConfList NewSection(const std::string& szName, const char* szNoNode, const char* szNoHash, const char* szFile,
                     int nLine);
 
-// A name beside szPath that nothing has yet: szPath and six more characters.
+// A name beside szPath that nothing has yet: szPath and six letters and digits, of which no two neighbours are of one
+// kind (small letter, capital, digit). The platform brings back what a killed writer left under such a name.
 std::string UniqueName(const char* szPath);
 
 // Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new

@@ -185,7 +185,9 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
         const char* szName;
         int nOlder;
         bool blGoes;
-    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confzzzzZ0", 1, true},   {"rule.confNewer1", -60, false},
+    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zz", 1, true},   {"rule.confN3wEr1", -60, false},
+                    {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false}, {"rule.confNov25a", 60, false},
+                    {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false},
                     {"rule.confbackup", 60, false}, {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},
                     {"rule.confaB3dE", 60, false},  {"rule.confaB3dE67", 60, false}};
     Write(kRuleConf, kOldRules);
@@ -207,14 +209,21 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
     EXPECT_TRUE(std::filesystem::is_symlink("/etc/portforward/rule.confaBcDe0"));
     EXPECT_EQ(Read(kRuleConf), kOldRules);
 
+    // What a person could have named is not taken for the rules, either.
     std::filesystem::remove(kRuleConf);
     EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
-    EXPECT_EQ(Read(kRuleConf), "[rule.confNewer1]\nenabled=1\n");
+    EXPECT_EQ(Read(kRuleConf), "[rule.confN3wEr1]\nenabled=1\n");
 }
 
 TEST_F(Faults, RulesLeftAsideAreNotNoRules) {
+    for (const char* szOwn : {"rule.conf.saved", "rule.confbackup", "rule.conf202401", "rule.confOld001",
+                              "rule.conf.aB3dE6"}) {
+        Write(std::string(kDir) + "/" + szOwn, kOldRules);
+        EXPECT_EQ(CountRules(), 0) << szOwn;
+        EXPECT_EQ(Names(), Lines{szOwn});
+        std::filesystem::remove_all(kDir);
+    }
     Write("/etc/portforward/rule.conf.saved", kOldRules);
-    EXPECT_EQ(CountRules(), 0);
     Write("/etc/portforward/rule.confaB3dE6", kOldRules);
     EXPECT_EQ(CountRules(), 1);
     EXPECT_EQ(Names(), (Lines{"rule.conf", "rule.conf.saved"}));

@@ -37,9 +37,10 @@ void TAVOPFConfFree(TAVO_PF_CONF* pHead);
  * one, or one that cannot be parsed, has a section name that does not fit or more than 16384 sections
  * (the last error tells them apart: TLIBC_ERR_NONE for empty, TLIBC_ERR_NOT_FOUND for no file).
  * Blank lines and comments alone are an empty file, and are taken out of it.
- * A writer moves the old file aside, to its name and six more letters and digits, before it writes the
- * new one. Where it was killed in between, the newest such copy is put back before the file is read;
- * copies that later writes made obsolete are deleted once they are ten minutes old. */
+ * A writer moves the old file aside, to its name and six more letters and digits of which no two neighbours
+ * are of one kind (small letter, capital, digit), before it writes the new one. Where it was killed in between,
+ * the newest such copy is put back before the file is read; copies that later writes made obsolete are deleted
+ * once they are ten minutes old. Any other name is a person's own copy, and left alone. */
 TAVO_PF_CONF* TAVOPFRuleGet(void);
 TAVO_PF_CONF* TAVOPFTestRuleGet(void);
 /* The sections whose names stand in szIdList (separated by "," or blanks), in file order; NULL or an

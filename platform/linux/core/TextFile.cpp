@@ -14,6 +14,7 @@
 #include <memory>
 
 #include "core/Descriptor.h"
+#include "core/Suffix.h"
 #include "tavo/core.h"
 
 namespace tavo {
@@ -198,8 +199,15 @@ bool WriteAll(int fd, std::string_view szText) {
 // A file that goes away again unless it took its final name.
 class NewFile {
 public:
-    explicit NewFile(const std::string& szTarget)
-        : mSzPath(szTarget + ".XXXXXX"), mFd(mkostemp(mSzPath.data(), O_CLOEXEC)) {}
+    explicit NewFile(const std::string& szTarget) {
+        for (int i = 0; i < kNameTries && mFd.Get() < 0; ++i) {
+            mSzPath = szTarget + "." + MakeSuffix();
+            mFd.Reset(open(mSzPath.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, kPrivateMode));
+            if (mFd.Get() < 0 && errno != EEXIST) {
+                return;
+            }
+        }
+    }
     ~NewFile() {
         if (mFd.Get() >= 0 && !mBlNamed) {
             unlink(mSzPath.c_str());
@@ -215,6 +223,7 @@ public:
     }
 
 private:
+    static constexpr int kNameTries = 100;
     std::string mSzPath;
     Descriptor mFd;
     bool mBlNamed = false;

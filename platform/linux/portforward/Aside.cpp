@@ -1,4 +1,4 @@
-// Finds the copies that killed writers left. Relies on the names that mktemp makes and on the file times.
+// Finds the copies that killed writers left. Relies on the names that writers choose and on the file times.
 // Promises: see Aside.h.
 #include "portforward/Aside.h"
 
@@ -15,24 +15,35 @@
 #include <vector>
 
 #include "core/Directory.h"
+#include "core/Suffix.h"
 
 namespace tavo {
 
 namespace {
 
-constexpr size_t kSuffix = 6;
-constexpr std::string_view kLetters = "0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
 
-// A copy that a writer moved aside, to the file's name and six more letters and digits, before writing.
+enum class Kind {
+    kNone,   // none of ours
+    kAside,  // what a writer moved aside, to the file's name and a suffix, before writing
+    kNew     // what a writer had begun to write: the name, "." and a suffix
+};
+
 struct AsideCopy {
     std::string szPath;
     struct stat status;
+    Kind enKind;
 };
 
-bool IsAsideName(std::string_view szSeen, std::string_view szName) {
-    return szSeen.size() == szName.size() + kSuffix && szSeen.starts_with(szName) &&
-           szSeen.substr(szName.size()).find_first_not_of(kLetters) == std::string_view::npos;
+Kind KindOf(std::string_view szSeen, std::string_view szName) {
+    if (!szSeen.starts_with(szName)) {
+        return Kind::kNone;
+    }
+    szSeen.remove_prefix(szName.size());
+    if (szSeen.starts_with('.')) {
+        return IsSuffix(szSeen.substr(1)) ? Kind::kNew : Kind::kNone;
+    }
+    return IsSuffix(szSeen) ? Kind::kAside : Kind::kNone;
 }
 
 std::vector<AsideCopy> AsideCopies(std::string_view szPath) {
@@ -41,8 +52,8 @@ std::vector<AsideCopy> AsideCopies(std::string_view szPath) {
     std::vector<AsideCopy> rgCopies;
     const auto rgszSeen = NamesIn(szDir);
     for (const std::string& szSeen : rgszSeen ? *rgszSeen : std::vector<std::string>()) {
-        AsideCopy copy{szDir + szSeen, {}};
-        if (IsAsideName(szSeen, szPath.substr(nName)) && stat(copy.szPath.c_str(), &copy.status) == 0 &&
+        AsideCopy copy{szDir + szSeen, {}, KindOf(szSeen, szPath.substr(nName))};
+        if (copy.enKind != Kind::kNone && stat(copy.szPath.c_str(), &copy.status) == 0 &&
             S_ISREG(copy.status.st_mode)) {
             rgCopies.push_back(std::move(copy));
         }
@@ -54,23 +65,17 @@ bool IsOlder(const timespec& one, const timespec& other) {
     return one.tv_sec != other.tv_sec ? one.tv_sec < other.tv_sec : one.tv_nsec < other.tv_nsec;
 }
 
-// Six random letters and digits; a word or a number ("rule.confbackup") is a person's own copy.
-bool IsRandomSuffix(std::string_view szSuffix) {
-    int nKinds = 0;
-    for (const std::string_view szKind : {kLetters.substr(0, 10), kLetters.substr(10, 26), kLetters.substr(36)}) {
-        nKinds += szSuffix.find_first_of(szKind) != std::string_view::npos ? 1 : 0;
-    }
-    return nKinds > 1;
+// Whether one copy has less to say than the other; what is half written has nothing.
+bool IsWorse(const AsideCopy& one, const AsideCopy& other) {
+    return one.enKind != other.enKind ? one.enKind == Kind::kNew : IsOlder(one.status.st_mtim, other.status.st_mtim);
 }
 
 }  // namespace
 
 void BringBack(const char* szPath) {
     const std::vector<AsideCopy> rgCopies = AsideCopies(szPath);
-    const auto newest = std::max_element(
-        rgCopies.begin(), rgCopies.end(),
-        [](const AsideCopy& one, const AsideCopy& other) { return IsOlder(one.status.st_mtim, other.status.st_mtim); });
-    if (newest != rgCopies.end() &&
+    const auto newest = std::max_element(rgCopies.begin(), rgCopies.end(), &IsWorse);
+    if (newest != rgCopies.end() && newest->enKind != Kind::kNew &&
         renameat2(AT_FDCWD, newest->szPath.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
         syslog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest->szPath.c_str());
     }
@@ -89,11 +94,10 @@ void DropObsolete(const char* szPath) {
     for (const AsideCopy& copy : rgCopies) {
         struct stat link = {};
         const bool blPlain = lstat(copy.szPath.c_str(), &link) == 0 && S_ISREG(link.st_mode);
-        const std::string_view szSuffix = std::string_view(copy.szPath).substr(copy.szPath.size() - kSuffix);
-        if (blPlain && IsRandomSuffix(szSuffix) && IsOlder(copy.status.st_mtim, live.st_mtim) &&
-            nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds && unlink(copy.szPath.c_str()) == 0) {
-            syslog(LOG_WARNING, "%s, which a killed writer left, is older than %s and deleted", copy.szPath.c_str(),
-                   szPath);
+        const bool blObsolete = copy.enKind == Kind::kNew || IsOlder(copy.status.st_mtim, live.st_mtim);
+        if (blPlain && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
+            unlink(copy.szPath.c_str()) == 0) {
+            syslog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
         }
     }
 }

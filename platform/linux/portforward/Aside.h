@@ -1,5 +1,6 @@
-// A writer of a rule or router file moves the old file aside, to its name and six random letters and digits,
-// before it writes the new one. What one that was killed left behind is mended here.
+// A writer of a rule or router file moves the old file aside, to its name and a suffix (see Suffix.h), before it
+// writes the new one, which stands under the name, "." and a suffix until it is whole. What a writer that was killed
+// left behind is mended here; a copy that a person could have named is nobody's business.
 // Relies on nothing. Promises: harmless while a writer is at work; what happened is logged.
 #pragma once
 
@@ -8,9 +9,8 @@ namespace tavo {
 // Where the file is missing, because a writer was killed in between, the newest copy takes its place
 // again. Nothing is ever replaced.
 void BringBack(const char* szPath);
-// Deletes copies that a newer file made obsolete: brought back at some later day, they would open ports
-// that nobody asks for any more. Those of the last ten minutes stay, and so does a name that a person
-// could have given ("rule.confbackup").
+// Deletes copies that a newer file made obsolete (brought back at some later day, they would open ports that nobody
+// asks for any more), and what was half written: either may hold a password. Those of the last ten minutes stay.
 void DropObsolete(const char* szPath);
 
 }  // namespace tavo
