@@ -121,6 +121,10 @@ int FillRouterConf(const char* szGwRouterIP, RouterConf& conf) {
         if (IsReadFailure(TLIBCErrGet())) {
             return -1;
         }
+        if (TLIBCErrGet() == TLIBC_ERR_NOT_FOUND) {  // a writer has it aside, and may have put it back by now
+            LogError("%s:%d file=%s not exists", kEntryFile, __LINE__, kRouterConf);
+            return kNothingStored;
+        }
         LogError("%s:%d file=%s has wrong format, try to unlink it", kEntryFile, __LINE__, kRouterConf);
         unlink(kRouterConf);
         return kNothingStored;
@@ -272,7 +276,10 @@ int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerCo
             !SetIdentity(writer, *routerConf)) {
             return -1;
         }
-        return FinishStoring(IsDaemonRouter(*routerConf) ? StoreDaemonRouter(writer)
-                                                         : StoreManual(writer, szGwRouterIP, *routerConf, pErr));
+        if (IsDaemonRouter(*routerConf)) {
+            return FinishStoring(StoreDaemonRouter(writer));
+        }
+        const tavo::lib::HeldFile held(kRouterConf);  // what is moved aside comes back by FinishStoring() alone
+        return FinishStoring(StoreManual(writer, szGwRouterIP, *routerConf, pErr));
     });
 }

@@ -61,7 +61,7 @@ private:
 // The router settings, moved aside for as long as the object lives.
 class SettingsAside {
 public:
-    SettingsAside() : mSzAside(tavo::lib::UniqueName(kRouterConf)) {}
+    SettingsAside() : mSettings(kRouterConf), mSzAside(tavo::lib::UniqueName(kRouterConf)) {}
     ~SettingsAside() {
         if (TLIBCFileExist(mSzAside.c_str()) == 1 && rename(mSzAside.c_str(), kRouterConf) != 0) {
             LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, mSzAside.c_str(), kRouterConf);
@@ -80,6 +80,7 @@ public:
 
 private:
     SignalsHeld mHeld;
+    tavo::lib::HeldFile mSettings;
     std::string mSzAside;
 };
 

@@ -261,6 +261,18 @@ void FileLock::LeaveToParent() {
     mFd = -1;
 }
 
+HeldFile::HeldFile(const char* szPath) : mFd(open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK)) {
+    if (mFd >= 0) {
+        flock(mFd, LOCK_EX | LOCK_NB);
+    }
+}
+
+HeldFile::~HeldFile() {
+    if (mFd >= 0) {
+        close(mFd);
+    }
+}
+
 bool IsGatewayAddress(const char* szGwRouterIP) {
     if (szGwRouterIP == nullptr) {
         LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);

@@ -104,6 +104,19 @@ public:
     RouterLock() : FileLock(kRouterLock) {}
 };
 
+// Holds the file at szPath locked, under whatever name it gets meanwhile, as long as the object and the process live:
+// readers bring back what a killed writer set aside, and leave alone what is held.
+class HeldFile {
+public:
+    explicit HeldFile(const char* szPath);
+    ~HeldFile();
+    HeldFile(const HeldFile&) = delete;
+    HeldFile& operator=(const HeldFile&) = delete;
+
+private:
+    int mFd;
+};
+
 // Whether a caller's gateway argument is an IP address; a refusal is logged.
 bool IsGatewayAddress(const char* szGwRouterIP);
 

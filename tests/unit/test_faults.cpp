@@ -8,7 +8,9 @@
 
 #include <algorithm>
 #include <functional>
+#include <memory>
 
+#include "InitState.h"
 #include "libtavoportmap.h"
 #include "stage.h"
 #include "tavo/core.h"
@@ -72,7 +74,11 @@ protected:
         gLog.clear();
         gSzGateway = "192.168.1.1";
     }
-    void TearDown() override { gNClockAhead = 0; }
+    void TearDown() override {
+        gNClockAhead = 0;
+        gFnOnConfSet = nullptr;
+        gStage = {};
+    }
 };
 
 TEST_F(Faults, APairThatCannotBeSetStopsTheRule) {
@@ -213,6 +219,101 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
     std::filesystem::remove(kRuleConf);
     EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
     EXPECT_EQ(Read(kRuleConf), "[rule.confN3wEr1]\nenabled=1\n");
+}
+
+using RouterConf = __tag_TAVO_ROUTER_CONF;
+
+// What a call does to the settings, wherever in it the process is killed.
+struct KilledCall {
+    const char* szWhat;
+    const char* szSupport;  // of the new settings; null: a report instead
+    int nToolVersion;
+    bool blMayBeNew;
+};
+
+constexpr char kOldSettings[] =
+    "[192.168.1.1]\nbrand=Old\nsupport_router_upnp=no\nsupport_router_natpmp=no\nuser=me\npass=secret\n";
+
+void CallAndDie(const KilledCall& call) {
+    if (call.szSupport == nullptr) {
+        gStage.blOn = true;
+        gStage.fnRun = [](const std::string& szCommand) {
+            rename("/nowhere", "/nowhere");  // one more place to die at
+            if (szCommand.starts_with("/bin/tar")) {
+                const size_t nName = szCommand.find('\'') + 1;
+                Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
+            }
+        };
+        TLibUploadTestUpnpCompatibilityFailResult();
+        return;
+    }
+    const auto pConf = std::make_unique<RouterConf>();
+    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"}, {pConf->szModel, "R1"},
+                                           {pConf->szVersion, "1.0"}, {pConf->szSupportUpnp, call.szSupport},
+                                           {pConf->szSupportNatpmp, "no"}, {pConf->szUser, "new"},
+                                           {pConf->szConnType, "http"}, {pConf->szConnPort, "80"}}) {
+        snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
+    }
+    TLibSetRouterConf("192.168.1.1", pConf.get(), nullptr, true);
+}
+
+TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
+    const KilledCall rgCalls[] = {{"a UPnP router", "yes", 1, true},
+                                  {"a router of pages", "no", 1, true},
+                                  {"one whose settings cannot be used", "no", 0, true}};
+    constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
+    Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
+          R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
+              "able_get_brand_model_version":"yes"})");
+    for (const KilledCall& call : rgCalls) {
+        Write(kTool, "#!/bin/sh\necho 'syntax version=" + std::to_string(call.nToolVersion) + "'\n");
+        chmod(kTool, 0755);
+        int nKilled = 0;
+        for (bool blKilled = true; blKilled && nKilled < 100; nKilled += blKilled ? 1 : 0) {
+            SetUp();
+            Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
+            Write(kRouterConf, kOldSettings);
+            const pid_t pid = fork();
+            if (pid == 0) {
+                gNGoodChanges = nKilled;
+                CallAndDie(call);
+                _exit(0);
+            }
+            int nStatus = 0;
+            ASSERT_EQ(waitpid(pid, &nStatus, 0), pid);
+            blKilled = WIFEXITED(nStatus) && WEXITSTATUS(nStatus) == kKilled;
+            const auto pConf = std::make_unique<RouterConf>();
+            for (const time_t nAhead : {0, 3600, 7200}) {
+                gNClockAhead = nAhead;
+                auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
+                const bool blRead = TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true) == 0;
+                const std::string szBrand = blRead ? pConf->szBrand : "nothing";
+                EXPECT_TRUE(szBrand == "Old" || (call.blMayBeNew && szBrand == "Acme"))
+                    << call.szWhat << ", killed at change " << nKilled << ", " << nAhead << " s later: " << szBrand;
+                EXPECT_TRUE(tavo::lib::GetInitState(&enState) == 0 && enState >= TAVO_ROUTER_INIT_STATE_UPNP_NATPMP);
+            }
+            Lines rgszLeft = Names();
+            rgszLeft.erase(std::remove(rgszLeft.begin(), rgszLeft.end(), "router.conf.bak"), rgszLeft.end());
+            EXPECT_EQ(rgszLeft, (Lines{"router.conf", "router_upnp.db"})) << call.szWhat << " " << nKilled;
+            gNClockAhead = 0;
+        }
+        EXPECT_GT(nKilled, 2) << call.szWhat;
+    }
+}
+
+TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
+    for (const char* szSupport : {"no", "yes"}) {
+        Write(kRouterConf, kOldSettings);
+        gFnOnConfSet = [] {
+            const auto pConf = std::make_unique<RouterConf>();
+            TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false);
+            return -1;
+        };
+        CallAndDie({"", szSupport, 1, true});
+        // A failed write of a UPnP router ends with no settings.
+        EXPECT_EQ(Read(kRouterConf), *szSupport == 'n' ? kOldSettings : "");
+    }
 }
 
 TEST_F(Faults, RulesLeftAsideAreNotNoRules) {

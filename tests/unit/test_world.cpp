@@ -2,6 +2,7 @@
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdarg>
@@ -16,6 +17,7 @@
 
 std::vector<std::string> gLog;
 std::string gSzFailRename;
+int gNGoodChanges = -1;
 std::string gSzGateway = "192.168.1.1";
 int gNSlept = 0;
 std::function<void()> gFnOnSleep;
@@ -36,6 +38,12 @@ bool AllocationFails() {
     gBlAllocationFailed = true;
     errno = ENOMEM;
     return true;
+}
+
+void Change() {
+    if (gNGoodChanges >= 0 && gNGoodChanges-- == 0) {
+        _exit(kKilled);
+    }
 }
 
 }  // namespace
@@ -81,7 +89,14 @@ void syslog(int /*nPriority*/, const char* szFormat, ...) {
     gLog.push_back(szText.substr(szText.find(' ') + 1));
 }
 
+int unlink(const char* szPath) noexcept {
+    Change();
+    static const auto fnReal = reinterpret_cast<int (*)(const char*)>(dlsym(RTLD_NEXT, "unlink"));
+    return fnReal(szPath);
+}
+
 int rename(const char* szFrom, const char* szTo) {
+    Change();
     if (gSzFailRename == szFrom) {
         gSzFailRename.clear();
         return -1;

@@ -16,6 +16,9 @@
 extern std::vector<std::string> gLog;
 // What the next rename of this source path does: fail, once.
 extern std::string gSzFailRename;
+// After so many changes of a name or a file's rights the process dies at the next one (never: negative).
+extern int gNGoodChanges;
+inline constexpr int kKilled = 77;
 // The default gateway that the platform reports; empty: none.
 extern std::string gSzGateway;
 // Seconds slept; sleep() only counts.

@@ -78,7 +78,8 @@ int TLIBCErrorGetLine(void);
  * failed write leaves the old file.
  */
 
-/* 1: something exists at szPath; 0: nothing does (or null). */
+/* 1: something exists at szPath; 0: nothing does (or null). A rule or router file that a killed writer left aside
+ * only is put back first (see portforward.h), so that it is missing for nobody. */
 int TLIBCFileExist(const char* szPath);
 /* Creates an empty file, or updates the times of one that is there. 0: done; -1: failed. */
 int TLIBCFileTouch(const char* szPath);

@@ -16,6 +16,7 @@
 #include "core/Descriptor.h"
 #include "core/RunKeys.h"
 #include "core/TextFile.h"
+#include "portforward/Aside.h"
 #include "tavo/core.h"
 
 namespace {
@@ -113,7 +114,16 @@ std::string WithLine(std::string_view szText, std::string_view szKey, const std:
 
 int TLIBCFileExist(const char* szPath) {
     struct stat status = {};
-    return szPath != nullptr && lstat(szPath, &status) == 0 ? 1 : 0;
+    if (szPath == nullptr) {
+        return 0;
+    }
+    if (lstat(szPath, &status) != 0) {
+        AtBorder(-1, [szPath] {
+            tavo::MendStore(szPath);
+            return 0;
+        });
+    }
+    return lstat(szPath, &status) == 0 ? 1 : 0;
 }
 
 int TLIBCFileTouch(const char* szPath) {

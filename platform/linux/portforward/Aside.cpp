@@ -3,6 +3,7 @@
 #include "portforward/Aside.h"
 
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -10,10 +11,12 @@
 #include <algorithm>
 #include <cstdio>
 #include <ctime>
+#include <iterator>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "core/Descriptor.h"
 #include "core/Directory.h"
 #include "core/Suffix.h"
 
@@ -21,11 +24,15 @@ namespace tavo {
 
 namespace {
 
+constexpr std::string_view kRouterName = "router.conf";
+constexpr std::string_view kStores[] = {"/etc/portforward/router.conf", "/etc/portforward/rule.conf",
+                                        "/etc/portforward/testrule.conf"};
 constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
 
 enum class Kind {
     kNone,   // none of ours
     kAside,  // what a writer moved aside, to the file's name and a suffix, before writing
+    kTried,  // what new settings that are only tried stand in for: the name and ".bak", of the router file alone
     kNew     // what a writer had begun to write: the name, "." and a suffix
 };
 
@@ -40,6 +47,9 @@ Kind KindOf(std::string_view szSeen, std::string_view szName) {
         return Kind::kNone;
     }
     szSeen.remove_prefix(szName.size());
+    if (szSeen == ".bak") {
+        return szName == kRouterName ? Kind::kTried : Kind::kNone;
+    }
     if (szSeen.starts_with('.')) {
         return IsSuffix(szSeen.substr(1)) ? Kind::kNew : Kind::kNone;
     }
@@ -65,19 +75,43 @@ bool IsOlder(const timespec& one, const timespec& other) {
     return one.tv_sec != other.tv_sec ? one.tv_sec < other.tv_sec : one.tv_nsec < other.tv_nsec;
 }
 
+// Whether the process lives that set the copy aside and wants it back itself: it holds it locked. Two who look at once
+// do not take each other for it.
+bool IsHeld(const AsideCopy& copy) {
+    const Descriptor fd(open(copy.szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+    return fd.Get() < 0 || flock(fd.Get(), LOCK_SH | LOCK_NB) != 0;
+}
+
 // Whether one copy has less to say than the other; what is half written has nothing.
 bool IsWorse(const AsideCopy& one, const AsideCopy& other) {
-    return one.enKind != other.enKind ? one.enKind == Kind::kNew : IsOlder(one.status.st_mtim, other.status.st_mtim);
+    const bool blHalf = one.enKind == Kind::kNew;
+    return blHalf != (other.enKind == Kind::kNew) ? blHalf : IsOlder(one.status.st_mtim, other.status.st_mtim);
 }
 
 }  // namespace
 
-void BringBack(const char* szPath) {
+bool BringBack(const char* szPath) {
+    struct stat live = {};
+    if (lstat(szPath, &live) == 0) {
+        return true;
+    }
     const std::vector<AsideCopy> rgCopies = AsideCopies(szPath);
     const auto newest = std::max_element(rgCopies.begin(), rgCopies.end(), &IsWorse);
-    if (newest != rgCopies.end() && newest->enKind != Kind::kNew &&
-        renameat2(AT_FDCWD, newest->szPath.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
+    if (newest == rgCopies.end() || newest->enKind == Kind::kNew) {
+        return true;
+    }
+    if (IsHeld(*newest)) {
+        return false;
+    }
+    if (renameat2(AT_FDCWD, newest->szPath.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
         syslog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest->szPath.c_str());
+    }
+    return true;
+}
+
+void MendStore(const char* szPath) {
+    if (std::find(std::begin(kStores), std::end(kStores), szPath) != std::end(kStores)) {
+        BringBack(szPath);
     }
 }
 
@@ -95,7 +129,7 @@ void DropObsolete(const char* szPath) {
         struct stat link = {};
         const bool blPlain = lstat(copy.szPath.c_str(), &link) == 0 && S_ISREG(link.st_mode);
         const bool blObsolete = copy.enKind == Kind::kNew || IsOlder(copy.status.st_mtim, live.st_mtim);
-        if (blPlain && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
+        if (blPlain && blObsolete && copy.enKind != Kind::kTried && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
             unlink(copy.szPath.c_str()) == 0) {
             syslog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
         }

@@ -6,11 +6,14 @@
 
 namespace tavo {
 
-// Where the file is missing, because a writer was killed in between, the newest copy takes its place
-// again. Nothing is ever replaced.
-void BringBack(const char* szPath);
+// Where the file is missing, because a writer was killed in between, the newest copy takes its place again; for
+// router.conf also router.conf.bak. Nothing is ever replaced. False: there is a copy, and it is left to its owner, who lives.
+bool BringBack(const char* szPath);
+// The same when szPath is one of the rule and router files; any other path is left alone.
+void MendStore(const char* szPath);
 // Deletes copies that a newer file made obsolete (brought back at some later day, they would open ports that nobody
-// asks for any more), and what was half written: either may hold a password. Those of the last ten minutes stay.
+// asks for any more), and what was half written: either may hold a password. Those of the last ten minutes stay, and so
+// does router.conf.bak, a name that a person might use as well: the next settings that are stored delete it.
 void DropObsolete(const char* szPath);
 
 }  // namespace tavo

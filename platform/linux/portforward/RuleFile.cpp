@@ -27,6 +27,7 @@ constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr int kMaxPort = 65535;
 constexpr int kLoadTries = 8;
+constexpr useconds_t kOwnerMicroseconds = 20000;  // who holds a copy is about to write
 
 using tavo::AtBorder;
 using tavo::ConfList;
@@ -53,7 +54,9 @@ TAVO_PF_CONF* Load(const char* szPath) {
         // A writer may be moving the file aside again and again, and a single look may find neither file nor
         // copy: "no rules" is said only when several find nothing.
         for (int i = 1; TLIBCErrGet() == TLIBC_ERR_NOT_FOUND && i < kLoadTries; ++i) {
-            tavo::BringBack(szPath);
+            if (!tavo::BringBack(szPath)) {
+                usleep(kOwnerMicroseconds);
+            }
             pList = tavo::LoadConfList(szPath);
         }
         if (TLIBCErrGet() == TLIBC_ERR_NONE) {
