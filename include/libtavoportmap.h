@@ -373,7 +373,7 @@ TAVO_API int TLibStopTestUpnpCompatibility(void);
 /* Keeps the outcome of a test as the user's own entry of the compatibility database, its only one. 0 or -1. */
 TAVO_API int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record);
 /* Sends the files of a failed test to the report server; the archive stays in /tmp. Takes the router lock itself; while
- * it runs, router.conf holds other settings. 0 or -1. */
+ * it packs, router.conf holds other settings. 0 or -1. */
 TAVO_API int TLibUploadTestUpnpCompatibilityFailResult(void);
 /* Makes the port connection test ready; needed before the first TLibTestRules, and again after
  * a compatibility test. 0 or -1. */

@@ -5,6 +5,7 @@
 #include <signal.h>
 
 #include <ctime>
+#include <optional>
 #include <string_view>
 
 #include "common.h"
@@ -58,20 +59,26 @@ private:
     sigset_t mBefore;
 };
 
-// The router settings, moved aside for as long as the object lives.
+// The router settings, moved aside until they are put back, or for as long as the object lives.
 class SettingsAside {
 public:
-    SettingsAside() : mSettings(kRouterConf), mSzAside(tavo::lib::UniqueName(kRouterConf)) {}
-    ~SettingsAside() {
-        if (TLIBCFileExist(mSzAside.c_str()) == 1 && rename(mSzAside.c_str(), kRouterConf) != 0) {
-            LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, mSzAside.c_str(), kRouterConf);
-        }
-    }
+    SettingsAside() : mSzAside(tavo::lib::UniqueName(kRouterConf, tavo::lib::AsideFor::kReport)) {}
+    ~SettingsAside() { PutBack(); }
     SettingsAside(const SettingsAside&) = delete;
     SettingsAside& operator=(const SettingsAside&) = delete;
 
-    bool Move() const {
-        if (TLIBCFileExist(kRouterConf) != 1 || rename(kRouterConf, mSzAside.c_str()) == 0) {
+    void PutBack() {
+        if (TLIBCFileExist(mSzAside.c_str()) == 1 && rename(mSzAside.c_str(), kRouterConf) != 0) {
+            LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, mSzAside.c_str(), kRouterConf);
+            return;
+        }
+        mSettings.reset();
+    }
+
+    bool Move() {
+        const bool blExist = TLIBCFileExist(kRouterConf) == 1;
+        mSettings.emplace(kRouterConf);
+        if (!blExist || rename(kRouterConf, mSzAside.c_str()) == 0) {
             return true;
         }
         LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());
@@ -80,7 +87,7 @@ public:
 
 private:
     SignalsHeld mHeld;
-    tavo::lib::HeldFile mSettings;
+    std::optional<tavo::lib::HeldFile> mSettings;
     std::string mSzAside;
 };
 
@@ -182,7 +189,7 @@ int TLibUploadTestUpnpCompatibilityFailResult() {
         if (!DescribeDetected(conf, szBrand)) {
             return -1;
         }
-        const SettingsAside aside;
+        SettingsAside aside;
         if (!aside.Move()) {
             return -1;
         }
@@ -196,6 +203,10 @@ int TLibUploadTestUpnpCompatibilityFailResult() {
             return -1;
         }
         const std::string szArchive = ArchiveName(ArchiveBrand(szBrand.c_str()));
-        return PackReport(szArchive) && SendReport(szArchive) ? 0 : -1;
+        if (!PackReport(szArchive)) {
+            return -1;
+        }
+        aside.PutBack();  // an upload may take minutes
+        return SendReport(szArchive) ? 0 : -1;
     });
 }

@@ -37,7 +37,7 @@ constexpr size_t kVersionSize = 1024;
 constexpr size_t kPathSize = 4096;
 constexpr size_t kToolLineSize = 1024;
 constexpr size_t kSuffixSize = 6;
-constexpr int kNameTries = 1000;  // one name in eleven is taken
+constexpr int kNameTries = 5000;  // one name in sixty is taken, at the worst
 constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
 constexpr std::string_view kVersionKey = "syntax version";
 
@@ -111,13 +111,14 @@ Kind KindOf(char c) {
 }
 
 // Whether the end of the name is none that a person gives to a copy: among its six characters no two neighbours
-// are of one kind. By that the platform knows what a killed writer left.
-bool IsUnmistakable(std::string_view szName) {
+// are of one kind. By that, and by a digit at the beginning, the platform knows what a killed process left.
+bool IsUnmistakable(std::string_view szName, bool blDigitFirst) {
     if (szName.size() < kSuffixSize) {
         return false;
     }
     const std::string_view szSuffix = szName.substr(szName.size() - kSuffixSize);
-    return std::adjacent_find(szSuffix.begin(), szSuffix.end(),
+    return (KindOf(szSuffix.front()) == Kind::kDigit) == blDigitFirst &&
+           std::adjacent_find(szSuffix.begin(), szSuffix.end(),
                               [](char c, char d) { return KindOf(c) == KindOf(d); }) == szSuffix.end();
 }
 
@@ -377,10 +378,10 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
     return pNode;
 }
 
-std::string UniqueName(const char* szPath) {
+std::string UniqueName(const char* szPath, AsideFor enFor) {
     const std::string szTemplate = std::string(szPath) + "XXXXXX";
     std::string szName;
-    for (int i = 0; i < kNameTries && !IsUnmistakable(szName); ++i) {
+    for (int i = 0; i < kNameTries && !IsUnmistakable(szName, enFor == AsideFor::kReport); ++i) {
         szName = szTemplate;
         // The name is only ever renamed to, never opened, and its directory is root's own.
 #pragma GCC diagnostic push
@@ -392,7 +393,7 @@ std::string UniqueName(const char* szPath) {
 }
 
 bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
-    const std::string szAside = UniqueName(szPath);
+    const std::string szAside = UniqueName(szPath, AsideFor::kWriting);
     if (TLIBCFileExist(szPath) == 1 && rename(szPath, szAside.c_str()) != 0) {
         LogError("%s:%d rename(%s, %s) failed ", kFile, __LINE__, szPath, szAside.c_str());
         if (TLIBCFileExist(szAside.c_str()) == 1) {

@@ -173,8 +173,10 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
                     int nLine);
 
 // A name beside szPath that nothing has yet: szPath and six letters and digits, of which no two neighbours are of one
-// kind (small letter, capital, digit). The platform brings back what a killed writer left under such a name.
-std::string UniqueName(const char* szPath);
+// kind (small letter, capital, digit). The platform brings back what a killed writer left under such a name: for one
+// that writes the file anew where it is missing, for a report (whose name has a digit first) whatever is there.
+enum class AsideFor { kWriting, kReport };
+std::string UniqueName(const char* szPath, AsideFor enFor);
 
 // Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new
 // one, and the old one is deleted after success (the new one takes its owner and mode) and renamed back

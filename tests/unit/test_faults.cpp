@@ -191,11 +191,11 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
         const char* szName;
         int nOlder;
         bool blGoes;
-    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zz", 1, true},   {"rule.confN3wEr1", -60, false},
-                    {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false}, {"rule.confNov25a", 60, false},
-                    {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false},
-                    {"rule.confbackup", 60, false}, {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},
-                    {"rule.confaB3dE", 60, false},  {"rule.confaB3dE67", 60, false}};
+    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zz", 1, true},    {"rule.confN3wEr1", -60, false},
+                    {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false},  {"rule.confNov25a", 60, false},
+                    {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false}, {"rule.confbackup", 60, false},
+                    {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},  {"rule.confaB3dE", 60, false},
+                    {"rule.confaB3dE67", 60, false}};
     Write(kRuleConf, kOldRules);
     symlink("/etc/portforward/rule.conf.saved", "/etc/portforward/rule.confaBcDe0");
     for (const auto& copy : rgCopies) {
@@ -236,10 +236,18 @@ constexpr char kOldSettings[] =
 
 void CallAndDie(const KilledCall& call) {
     if (call.szSupport == nullptr) {
+        Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
+              R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
+                  "able_get_brand_model_version":"yes"})");
         gStage.blOn = true;
         gStage.fnRun = [](const std::string& szCommand) {
             rename("/nowhere", "/nowhere");  // one more place to die at
-            if (szCommand.starts_with("/bin/tar")) {
+            const auto pConf = std::make_unique<RouterConf>();
+            const bool blPacking = szCommand.starts_with("/bin/tar");
+            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false), 0);
+            EXPECT_STREQ(pConf->szBrand, blPacking ? "Acme" : "Old");
+            EXPECT_STREQ(pConf->szPass, blPacking ? "" : "secret");
+            if (blPacking) {
                 const size_t nName = szCommand.find('\'') + 1;
                 Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
             }
@@ -248,10 +256,14 @@ void CallAndDie(const KilledCall& call) {
         return;
     }
     const auto pConf = std::make_unique<RouterConf>();
-    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"}, {pConf->szModel, "R1"},
-                                           {pConf->szVersion, "1.0"}, {pConf->szSupportUpnp, call.szSupport},
-                                           {pConf->szSupportNatpmp, "no"}, {pConf->szUser, "new"},
-                                           {pConf->szConnType, "http"}, {pConf->szConnPort, "80"}}) {
+    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"},
+                                           {pConf->szModel, "R1"},
+                                           {pConf->szVersion, "1.0"},
+                                           {pConf->szSupportUpnp, call.szSupport},
+                                           {pConf->szSupportNatpmp, "no"},
+                                           {pConf->szUser, "new"},
+                                           {pConf->szConnType, "http"},
+                                           {pConf->szConnPort, "80"}}) {
         snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
     }
     TLibSetRouterConf("192.168.1.1", pConf.get(), nullptr, true);
@@ -260,12 +272,10 @@ void CallAndDie(const KilledCall& call) {
 TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
     const KilledCall rgCalls[] = {{"a UPnP router", "yes", 1, true},
                                   {"a router of pages", "no", 1, true},
-                                  {"one whose settings cannot be used", "no", 0, true}};
+                                  {"one whose settings cannot be used", "no", 0, true},
+                                  {"a report", nullptr, 1, false}};
     constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
     Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-    Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
-          R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
-              "able_get_brand_model_version":"yes"})");
     for (const KilledCall& call : rgCalls) {
         Write(kTool, "#!/bin/sh\necho 'syntax version=" + std::to_string(call.nToolVersion) + "'\n");
         chmod(kTool, 0755);
@@ -314,11 +324,15 @@ TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
         // A failed write of a UPnP router ends with no settings.
         EXPECT_EQ(Read(kRouterConf), *szSupport == 'n' ? kOldSettings : "");
     }
+    Write(kRouterConf, kOldSettings);
+    gFnOnConfSet = nullptr;
+    CallAndDie({"", nullptr, 1, false});
+    EXPECT_EQ(Read(kRouterConf), kOldSettings);
 }
 
 TEST_F(Faults, RulesLeftAsideAreNotNoRules) {
     for (const char* szOwn : {"rule.conf.saved", "rule.confbackup", "rule.conf202401", "rule.confOld001",
-                              "rule.conf.aB3dE6"}) {
+                              "rule.conf.aB3dE6", "rule.conf.bak"}) {
         Write(std::string(kDir) + "/" + szOwn, kOldRules);
         EXPECT_EQ(CountRules(), 0) << szOwn;
         EXPECT_EQ(Names(), Lines{szOwn});

@@ -117,12 +117,10 @@ int TLIBCFileExist(const char* szPath) {
     if (szPath == nullptr) {
         return 0;
     }
-    if (lstat(szPath, &status) != 0) {
-        AtBorder(-1, [szPath] {
-            tavo::MendStore(szPath);
-            return 0;
-        });
-    }
+    AtBorder(-1, [szPath] {
+        tavo::MendStore(szPath);
+        return 0;
+    });
     return lstat(szPath, &status) == 0 ? 1 : 0;
 }
 

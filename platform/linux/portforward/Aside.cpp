@@ -30,10 +30,11 @@ constexpr std::string_view kStores[] = {"/etc/portforward/router.conf", "/etc/po
 constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
 
 enum class Kind {
-    kNone,   // none of ours
-    kAside,  // what a writer moved aside, to the file's name and a suffix, before writing
-    kTried,  // what new settings that are only tried stand in for: the name and ".bak", of the router file alone
-    kNew     // what a writer had begun to write: the name, "." and a suffix
+    kNone,      // none of ours
+    kAside,     // what a writer moved aside, to the file's name and a suffix, before writing
+    kReported,  // the router's settings that a report has set aside: the suffix begins with a digit
+    kTried,     // what new settings that are only tried stand in for: the name and ".bak", of the router file alone
+    kNew        // what a writer had begun to write: the name, "." and a suffix
 };
 
 struct AsideCopy {
@@ -53,7 +54,10 @@ Kind KindOf(std::string_view szSeen, std::string_view szName) {
     if (szSeen.starts_with('.')) {
         return IsSuffix(szSeen.substr(1)) ? Kind::kNew : Kind::kNone;
     }
-    return IsSuffix(szSeen) ? Kind::kAside : Kind::kNone;
+    if (!IsSuffix(szSeen)) {
+        return Kind::kNone;
+    }
+    return szName == kRouterName && szSeen.front() >= '0' && szSeen.front() <= '9' ? Kind::kReported : Kind::kAside;
 }
 
 std::vector<AsideCopy> AsideCopies(std::string_view szPath) {
@@ -88,14 +92,44 @@ bool IsWorse(const AsideCopy& one, const AsideCopy& other) {
     return blHalf != (other.enKind == Kind::kNew) ? blHalf : IsOlder(one.status.st_mtim, other.status.st_mtim);
 }
 
+// What a report that was killed has set aside takes its place again, whatever the report has put there. Were there
+// two, the later one would be what the earlier report had made.
+void BringBackReported(const char* szPath, const std::vector<AsideCopy>& rgCopies) {
+    std::vector<AsideCopy> rgReported;
+    std::copy_if(rgCopies.begin(), rgCopies.end(), std::back_inserter(rgReported),
+                 [](const AsideCopy& copy) { return copy.enKind == Kind::kReported && !IsHeld(copy); });
+    std::sort(rgReported.begin(), rgReported.end(), [](const AsideCopy& one, const AsideCopy& other) {
+        return IsOlder(one.status.st_ctim, other.status.st_ctim);
+    });
+    bool blBack = false;
+    for (const AsideCopy& copy : rgReported) {
+        if (blBack) {
+            unlink(copy.szPath.c_str());
+        } else if (rename(copy.szPath.c_str(), szPath) == 0) {
+            blBack = true;
+            syslog(LOG_WARNING, "a report was killed; the settings that it had set aside as %s are %s again",
+                   copy.szPath.c_str(), szPath);
+        }
+    }
+}
+
+bool IsThere(const char* szPath) {
+    struct stat live = {};
+    return lstat(szPath, &live) == 0;
+}
+
 }  // namespace
 
 bool BringBack(const char* szPath) {
-    struct stat live = {};
-    if (lstat(szPath, &live) == 0) {
+    const bool blRouter = std::string_view(szPath).ends_with(std::string("/").append(kRouterName));
+    if (!blRouter && IsThere(szPath)) {
         return true;
     }
     const std::vector<AsideCopy> rgCopies = AsideCopies(szPath);
+    BringBackReported(szPath, rgCopies);
+    if (IsThere(szPath)) {
+        return true;
+    }
     const auto newest = std::max_element(rgCopies.begin(), rgCopies.end(), &IsWorse);
     if (newest == rgCopies.end() || newest->enKind == Kind::kNew) {
         return true;
@@ -129,7 +163,8 @@ void DropObsolete(const char* szPath) {
         struct stat link = {};
         const bool blPlain = lstat(copy.szPath.c_str(), &link) == 0 && S_ISREG(link.st_mode);
         const bool blObsolete = copy.enKind == Kind::kNew || IsOlder(copy.status.st_mtim, live.st_mtim);
-        if (blPlain && blObsolete && copy.enKind != Kind::kTried && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
+        const bool blWriters = copy.enKind == Kind::kNew || copy.enKind == Kind::kAside;
+        if (blPlain && blWriters && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
             unlink(copy.szPath.c_str()) == 0) {
             syslog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
         }

@@ -7,7 +7,9 @@
 namespace tavo {
 
 // Where the file is missing, because a writer was killed in between, the newest copy takes its place again; for
-// router.conf also router.conf.bak. Nothing is ever replaced. False: there is a copy, and it is left to its owner, who lives.
+// router.conf also router.conf.bak. Nothing is
+// replaced, but for what a report that was killed put in the place of the settings: they come back from the name and
+// a suffix that begins with a digit. False: there is a copy, and it is left to its owner, who lives.
 bool BringBack(const char* szPath);
 // The same when szPath is one of the rule and router files; any other path is left alone.
 void MendStore(const char* szPath);

@@ -50,6 +50,7 @@ void EmptyOut(const char* szPath) {
 
 TAVO_PF_CONF* Load(const char* szPath) {
     return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] {
+        tavo::BringBack(szPath);
         ConfList pList = tavo::LoadConfList(szPath);
         // A writer may be moving the file aside again and again, and a single look may find neither file nor
         // copy: "no rules" is said only when several find nothing.
