@@ -8,6 +8,7 @@
 #include <CLI/StringTools.hpp>
 #include <algorithm>
 #include <chrono>
+#include <numeric>
 #include <thread>
 
 #include "Box.h"
@@ -176,12 +177,29 @@ std::optional<Reply> Refused(const StoredRouter& router, const std::string& szGa
     return Fits(router, szGateway, rules, result) ? std::nullopt : std::optional(Explain(result, router, rules.size()));
 }
 
+// What a rule file needs for a rule beside its texts.
+constexpr size_t kRuleBytes =
+    sizeof("[]\nenabled=\"1\"\ns_port=\"\"\nr_port=\"\"\nprotocol name=\"\"\nservice_id=\"\"\nservice=\"\"\n");
+
+size_t BytesOf(const Rules& rules) {
+    return std::accumulate(rules.begin(), rules.end(), size_t{0}, [](size_t nBytes, const Rule& rule) {
+        return nBytes + kRuleBytes + rule.szId.size() + rule.szBoxPorts.size() + rule.szRouterPorts.size() +
+               rule.szProtocol.size() + rule.szServiceId.size() + rule.szName.size();
+    });
+}
+
 // What a rule file cannot hold, or nobody could read again.
 std::optional<Reply> Unwritable(const Rules& rules) {
     if (rules.size() > TAVO_PF_MAX_SECTIONS) {
         return Reply{.enExit = kTooMany,
                      .szMessage = fmt::format("a rule file holds {} rules and there are {}. Nothing was changed",
                                               static_cast<int>(TAVO_PF_MAX_SECTIONS), rules.size())};
+    }
+    if (BytesOf(rules) > TLIBC_MAX_FILE) {
+        return Reply{.enExit = kTooMany,
+                     .szMessage =
+                         "a rule file holds 16 MiB, and the names and port lists of these rules are more. "
+                         "Nothing was changed"};
     }
     if (!ToRecords(rules)) {
         return Failure(

@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <functional>
 #include <thread>
 
 #include "core/TextFile.h"
@@ -89,6 +90,29 @@ TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
                               "[a]\nk=\"\\x00\"\n", "[a]\n=v\n"}) {
         EXPECT_FALSE(tavo::ParseSections(szBad)) << szBad;
     }
+}
+
+TEST(SectionedFile, WhatNoReaderTakesIsNotWritten) {
+    const std::string szOld = "[a]\nk=1\n";
+    const std::string szHuge(16U << 20U, 'x');
+    TLIBCSzHash* pHash = TLIBCSzHashAlloc(1);
+    TLIBCSzHashSetValue(pHash, "k", szHuge.c_str());
+    TAVO_PF_CONF conf = {"b", pHash, nullptr};
+    const std::function<int()> rgWrites[] = {[&] { return TLIBCFileAddSection(kPath, "b", pHash, 0); },
+                                             [&] { return TAVOPFRuleBuildByPath(&conf, kPath); },
+                                             [&] { return TLIBCFileSetKeyValue(kPath, "k", szHuge.c_str(), nullptr); }};
+    for (const auto& fnWrite : rgWrites) {
+        Write(kPath, szOld);
+        EXPECT_LT(fnWrite(), 0);
+        EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_WRITE);
+        EXPECT_TRUE(Read(kPath) == szOld);
+    }
+    TLIBCSzHashFree(pHash);
+    // The most that there may be is read again.
+    const std::string szMost = "[a]\nk=" + szHuge.substr(6);
+    EXPECT_TRUE(tavo::WriteFileAtomic(kPath, szMost));
+    EXPECT_TRUE(tavo::ReadFile(kPath) == szMost);
+    EXPECT_FALSE(tavo::WriteFileAtomic(kPath, szMost + "x"));
 }
 
 TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {

@@ -78,6 +78,8 @@ int TLIBCErrorGetLine(void);
  * failed write leaves the old file.
  */
 
+enum { TLIBC_MAX_FILE = 16 << 20 /* bytes of a file; more is neither read nor written */ };
+
 /* 1: something exists at szPath; 0: nothing does (or null). A rule or router file that a killed writer left aside
  * only is put back first (see portforward.h), so that it is missing for nobody. */
 int TLIBCFileExist(const char* szPath);

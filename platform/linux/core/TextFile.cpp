@@ -22,7 +22,7 @@ namespace tavo {
 namespace {
 
 constexpr char kFile[] = "platform/linux/core/TextFile.cpp";
-constexpr size_t kMaxFile = 16U << 20U;
+constexpr size_t kMaxFile = TLIBC_MAX_FILE;
 constexpr char kHexDigits[] = "0123456789abcdef";
 
 bool Fail(int nErr, int nLine) {
@@ -302,6 +302,9 @@ std::optional<std::string> ReadFile(const std::string& szPath) {
 
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode,
                      const std::function<bool(int fd)>& fnWhole) {
+    if (szText.size() > kMaxFile) {
+        return Fail(TLIBC_ERR_WRITE, __LINE__);
+    }
     const std::string szTarget = Resolve(szPath);
     const std::string szDir = DirectoryOf(szTarget);  // beforehand: nothing may fail any more after the renaming
     NewFile file(szTarget);

@@ -37,7 +37,7 @@ TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath)
 
 // Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
 // (nNewMode for a new file), renamed over it. A link is followed. fnWhole is shown the new file while the old one
-// stands, and may refuse it. False with the last error set.
+// stands, and may refuse it. False with the last error set, also for a text that ReadFile would refuse.
 TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_view szText,
                                        mode_t nNewMode = kPrivateMode,
                                        const std::function<bool(int fd)>& fnWhole = nullptr);
