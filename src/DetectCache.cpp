@@ -230,12 +230,14 @@ int DetectCacheWriter::SetVersion(const std::string& version) {
 }
 
 int DetectCacheWriter::Sync() {
+    const tavo::lib::OwnerAndMode old(SZF_DETECT_MANUAL_CACHE.c_str());
     CleanDetectManualCache();
     if (TLIBCFileAddSection(SZF_DETECT_MANUAL_CACHE.c_str(), mSzSection.c_str(), mPHash, 0) != 1) {
         LogError("%s:%d TLIBCFileAddSection() failed[0x%04X %s:%d]", kFile, __LINE__,
                  static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
         return 0;
     }
+    old.GiveTo(SZF_DETECT_MANUAL_CACHE.c_str());
     return 1;
 }
 

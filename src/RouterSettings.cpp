@@ -199,6 +199,7 @@ Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const Rou
     if (!SetAccount(writer, conf)) {
         return Stored::kRefused;
     }
+    const tavo::lib::OwnerAndMode old(kRouterConf);
     if (TLIBCFileExist(kRouterConf) == 1 && !RenameOrLog(kRouterConf, kRouterConfBak, __LINE__)) {
         return Stored::kRefused;
     }
@@ -206,6 +207,7 @@ Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const Rou
         LogError("%s:%d sync config failed", kEntryFile, __LINE__);
         return Stored::kUndo;
     }
+    old.GiveTo(kRouterConf);
     int nDescribed = 0;
     if (!db.GetSyntaxVersion(nDescribed)) {
         LogError("%s:%d can not get router syntax version", kEntryFile, __LINE__);

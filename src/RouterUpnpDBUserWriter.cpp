@@ -56,6 +56,7 @@ bool RouterUpnpDBUserWriter::SetMaxRule(int nMaxRule) {
 }
 
 bool RouterUpnpDBUserWriter::Sync() {
+    const tavo::lib::OwnerAndMode old(kUpnpUserDb);
     if (TLIBCFileExist(kUpnpUserDb) == 1) {
         unlink(kUpnpUserDb);
     }
@@ -67,5 +68,6 @@ bool RouterUpnpDBUserWriter::Sync() {
                  static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
         return false;
     }
+    old.GiveTo(kUpnpUserDb);
     return true;
 }

@@ -76,9 +76,8 @@ public:
     }
 
     bool Move() {
-        const bool blExist = TLIBCFileExist(kRouterConf) == 1;
         mSettings.emplace(kRouterConf);
-        if (!blExist || rename(kRouterConf, mSzAside.c_str()) == 0) {
+        if (TLIBCFileExist(kRouterConf) != 1 || rename(kRouterConf, mSzAside.c_str()) == 0) {
             return true;
         }
         LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());

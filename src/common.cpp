@@ -88,19 +88,6 @@ void RenameLogged(const char* szFrom, const char* szTo, int nLine) {
     }
 }
 
-// The new file is made afresh; whoever may read the old one may read it too.
-void KeepOwnerAndMode(const char* szOld, const char* szNew) {
-    struct stat status = {};
-    struct stat own = {};
-    if (stat(szOld, &status) != 0 || stat(szNew, &own) != 0) {
-        return;
-    }
-    const bool blSameOwner = own.st_uid == status.st_uid && own.st_gid == status.st_gid;
-    if (blSameOwner || chown(szNew, status.st_uid, status.st_gid) == 0) {
-        chmod(szNew, status.st_mode & 07777U);
-    }
-}
-
 enum class Kind { kSmall, kCapital, kDigit, kOther };
 
 Kind KindOf(char c) {
@@ -262,8 +249,22 @@ void FileLock::LeaveToParent() {
     mFd = -1;
 }
 
-HeldFile::HeldFile(const char* szPath) : mFd(open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK)) {
-    if (mFd >= 0) {
+OwnerAndMode::OwnerAndMode(const char* szPath) : mBlKnown(stat(szPath, &mStatus) == 0) {}
+
+void OwnerAndMode::GiveTo(const char* szPath) const {
+    struct stat own = {};
+    if (!mBlKnown || stat(szPath, &own) != 0) {
+        return;
+    }
+    const bool blSameOwner = own.st_uid == mStatus.st_uid && own.st_gid == mStatus.st_gid;
+    if (blSameOwner || chown(szPath, mStatus.st_uid, mStatus.st_gid) == 0) {
+        chmod(szPath, mStatus.st_mode & 07777U);
+    }
+}
+
+HeldFile::HeldFile(const char* szPath) {
+    if (TLIBCFileExist(szPath) == 1) {  // and back in its place, where somebody was killed before
+        mFd = open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
         flock(mFd, LOCK_EX | LOCK_NB);
     }
 }
@@ -407,7 +408,7 @@ bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
     }
     if (TLIBCFileExist(szAside.c_str()) == 1) {
         if (blWritten) {
-            KeepOwnerAndMode(szAside.c_str(), szPath);
+            OwnerAndMode(szAside.c_str()).GiveTo(szPath);
             unlink(szAside.c_str());
         } else {
             RenameLogged(szAside.c_str(), szPath, __LINE__);

@@ -3,6 +3,8 @@
 // Promises nothing beyond this library: none of these names is exported.
 #pragma once
 
+#include <sys/stat.h>
+
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
@@ -104,6 +106,18 @@ public:
     RouterLock() : FileLock(kRouterLock) {}
 };
 
+// Owner and mode of the file at szPath. One that is made afresh in its place takes them: whoever may read the old one
+// may read it too.
+class OwnerAndMode {
+public:
+    explicit OwnerAndMode(const char* szPath);
+    void GiveTo(const char* szPath) const;
+
+private:
+    struct stat mStatus = {};
+    bool mBlKnown;
+};
+
 // Holds the file at szPath locked, under whatever name it gets meanwhile, as long as the object and the process live:
 // readers bring back what a killed writer set aside, and leave alone what is held.
 class HeldFile {
@@ -114,7 +128,7 @@ public:
     HeldFile& operator=(const HeldFile&) = delete;
 
 private:
-    int mFd;
+    int mFd = -1;
 };
 
 // Whether a caller's gateway argument is an IP address; a refusal is logged.

@@ -313,8 +313,11 @@ TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
 }
 
 TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
-    for (const char* szSupport : {"no", "yes"}) {
-        Write(kRouterConf, kOldSettings);
+    const std::string szKilled = std::string(kRouterConf) + ".bak";  // of one before
+    for (const auto& [szSupport, szFile] :
+         {std::pair{"no", kRouterConf}, {"no", szKilled.c_str()}, {"yes", kRouterConf}}) {
+        std::filesystem::remove(kRouterConf);
+        Write(szFile, kOldSettings);
         gFnOnConfSet = [] {
             const auto pConf = std::make_unique<RouterConf>();
             TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false);
@@ -375,14 +378,55 @@ TEST_F(Faults, ReadersNeverSeeFewerRulesThanTwoWritersWrite) {
     EXPECT_EQ(CountRules(), 2);
 }
 
-TEST_F(Faults, AReplacedFileKeepsItsMode) {
-    Write(kRuleConf, kOldRules);
-    chmod(kRuleConf, 0640);
-    RouterRuleConfWriter writer;
-    EXPECT_EQ(Add(writer) + writer.Sync(), 2);
-    struct stat status = {};
-    stat(kRuleConf, &status);
-    EXPECT_EQ(status.st_mode & 07777U, 0640U);
+TEST_F(Faults, AReplacedFileKeepsOwnerAndMode) {
+    const std::string szCache = SZF_DETECT_MANUAL_CACHE;
+    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
+    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=1'\n");
+    chmod("/usr/tavo/bin/tavoportforward", 0755);
+    const struct {
+        std::string szFile;
+        std::function<void()> fnWrite;
+    } rgWrites[] = {
+        {kRuleConf,
+         [] {
+             RouterRuleConfWriter writer;
+             EXPECT_EQ(Add(writer) + writer.Sync(), 2);
+         }},
+        {kRouterConf,
+         [] {
+             RouterConfWriter writer(true);
+             EXPECT_EQ(writer.SetBrand("new") + writer.Sync(), 2);
+         }},
+        {kRouterConf,
+         [] {
+             CallAndDie({"", "yes", 1, true});
+         }},
+        {kRouterConf,
+         [] {
+             CallAndDie({"", "no", 1, true});
+         }},
+        {szCache, [] { EXPECT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1); }},
+        {"/etc/portforward/router_upnp.db.user",
+         [] {
+             RouterUpnpDBUserWriter writer("a/b/c");
+             EXPECT_TRUE(writer.SetMaxRule(5) && writer.Sync());
+         }},
+        {kSystemConf, [] { EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr), 1); }},
+    };
+    for (const auto& write : rgWrites) {
+        SCOPED_TRACE(write.szFile);
+        const char* szFile = write.szFile.c_str();
+        Write(szFile, "");
+        chmod(szFile, 0640);
+        const bool blOthers = chown(szFile, 1, 1) == 0;  // where there are other users
+        write.fnWrite();
+        struct stat status = {};
+        stat(szFile, &status);
+        EXPECT_GT(status.st_size, 0);
+        EXPECT_EQ(status.st_mode & 07777U, 0640U);
+        EXPECT_EQ(status.st_uid + status.st_gid, blOthers ? 2U : 0U);
+        std::filesystem::remove(szFile);
+    }
 }
 
 }  // namespace
