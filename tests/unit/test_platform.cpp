@@ -11,6 +11,7 @@
 #include <functional>
 #include <thread>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/Wanted.h"
 #include "daemons/tavohook/Hooks.h"
@@ -152,6 +153,29 @@ TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {
     std::filesystem::remove("/etc/portforward/rule.conf");
     EXPECT_EQ(TAVOPFRuleGet(), nullptr);
     EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_NOT_FOUND);
+}
+
+TEST(SystemLog, ALineStaysOneLineOfPlainText) {
+    const char* rgszCases[][2] = {{"a\nb\r\t\x1b[2J\x7f", "a\\x0ab\\x0d\\x09\\x1b[2J\\x7f"},
+                                  {"\xc2\x9b"
+                                   "31m \xc3\xa4\xc2\xa0\\x",
+                                   "\\x9b31m \xc3\xa4\xc2\xa0\\x"},
+                                  {"\xc2", "\xc2"}};
+    for (const auto& rgszCase : rgszCases) {
+        gLog.clear();
+        tavo::SysLog(LOG_ERR, "say %s", rgszCase[0]);
+        EXPECT_EQ(gLog, std::vector<std::string>{rgszCase[1]});
+    }
+    gLog.clear();
+    tavo::SysLog(LOG_ERR, "say %s", std::string(100000, '\n').c_str());
+    EXPECT_EQ(gLog.front().substr(0, 8), "\\x0a\\x0a");
+    // A value on its way through the platform.
+    gLog.clear();
+    Write("/tmp/t/a\nb", "no section\n");
+    TLIBCSzHash* pHash = TLIBCSzHashAlloc(1);
+    EXPECT_LT(TLIBCFileGetSection("/tmp/t/a\nb", "s", pHash), 0);
+    TLIBCSzHashFree(pHash);
+    EXPECT_EQ(gLog.front().find('\n'), std::string::npos);
 }
 
 TEST(KeyFile, ChangesOneLineAndCanBeSourced) {

@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <stdlib.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -12,6 +11,7 @@
 #include <string>
 
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -44,10 +44,10 @@ bool MakeOwnFile(const char* szPath) {
         const bool blDone = Rename(szAside, szPath, blThere ? RENAME_EXCHANGE : RENAME_NOREPLACE);
         const int nErrno = errno;
         if (blDone && blThere) {
-            syslog(LOG_WARNING, "%s was not ours alone; another file stands there now", szPath);
+            SysLog(LOG_WARNING, "%s was not ours alone; another file stands there now", szPath);
         }
         if ((!blDone || blThere) && std::remove(szAside.c_str()) != 0 && errno == ENOTEMPTY) {
-            syslog(LOG_WARNING, "what stood in its place is %s now", szAside.c_str());
+            SysLog(LOG_WARNING, "what stood in its place is %s now", szAside.c_str());
         }
         if (blDone) {
             return true;

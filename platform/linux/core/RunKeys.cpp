@@ -7,7 +7,6 @@
 #include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -17,6 +16,7 @@
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
@@ -229,7 +229,8 @@ bool SetKey(const Daemon& daemon, bool blNow, bool blWanted) {
     if (TLIBCFileSetKeyValue(kSystemConf, daemon.szKey, blWanted ? "yes" : "no", nullptr) != 1) {
         return false;
     }
-    syslog(LOG_NOTICE, "%s=\"%s\" again: what switched it came to nothing", daemon.szKey, blWanted ? "yes" : "no");
+    tavo::SysLog(LOG_NOTICE, "%s=\"%s\" again: what switched it came to nothing", daemon.szKey,
+                 blWanted ? "yes" : "no");
     if (blWanted) {
         Tell(daemon);
     }

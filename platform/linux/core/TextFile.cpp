@@ -5,7 +5,6 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -15,6 +14,7 @@
 
 #include "core/Descriptor.h"
 #include "core/Suffix.h"
+#include "core/SysLog.h"
 #include "tavo/core.h"
 
 namespace tavo {
@@ -370,7 +370,7 @@ std::optional<std::vector<Section>> LoadSections(const std::string& szPath) {
     size_t nBadLine = 0;
     std::optional<std::vector<Section>> rgSections = ParseSections(*szText, &nBadLine);
     if (!rgSections) {
-        syslog(LOG_ERR, "%s, line %zu: neither a section nor a key; the file is left alone and not used",
+        SysLog(LOG_ERR, "%s, line %zu: neither a section nor a key; the file is left alone and not used",
                szPath.c_str(), nBadLine);
     }
     return rgSections;

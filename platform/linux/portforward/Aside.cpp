@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -19,6 +18,7 @@
 #include "core/Descriptor.h"
 #include "core/Directory.h"
 #include "core/Suffix.h"
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -107,7 +107,7 @@ void BringBackReported(const char* szPath, const std::vector<AsideCopy>& rgCopie
             unlink(copy.szPath.c_str());
         } else if (rename(copy.szPath.c_str(), szPath) == 0) {
             blBack = true;
-            syslog(LOG_WARNING, "a report was killed; the settings that it had set aside as %s are %s again",
+            SysLog(LOG_WARNING, "a report was killed; the settings that it had set aside as %s are %s again",
                    copy.szPath.c_str(), szPath);
         }
     }
@@ -138,7 +138,7 @@ bool BringBack(const char* szPath) {
         return false;
     }
     if (renameat2(AT_FDCWD, newest->szPath.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
-        syslog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest->szPath.c_str());
+        SysLog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest->szPath.c_str());
     }
     return true;
 }
@@ -166,7 +166,7 @@ void DropObsolete(const char* szPath) {
         const bool blWriters = copy.enKind == Kind::kNew || copy.enKind == Kind::kAside;
         if (blPlain && blWriters && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
             unlink(copy.szPath.c_str()) == 0) {
-            syslog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
+            SysLog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
         }
     }
 }

@@ -3,7 +3,6 @@
 #include "portforward/RouterDatabase.h"
 
 #include <fcntl.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -13,6 +12,7 @@
 
 #include "core/Border.h"
 #include "core/Directory.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterScript.h"
@@ -142,7 +142,7 @@ std::vector<std::string> Directories(const fs::path& dir) {
 
 void BringBackDatabase() {
     if (renameat2(AT_FDCWD, kDatabaseAside, AT_FDCWD, kDatabase, RENAME_NOREPLACE) == 0) {
-        syslog(LOG_WARNING, "%s was missing; the one before is back in its place", kDatabase);
+        SysLog(LOG_WARNING, "%s was missing; the one before is back in its place", kDatabase);
     }
 }
 

@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <stdlib.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -18,6 +17,7 @@
 #include "core/Border.h"
 #include "core/Descriptor.h"
 #include "core/Directory.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
 #include "portforward/RouterDatabase.h"
@@ -50,7 +50,7 @@ char (&Reason())[kMaxReason + 1] {
 
 int Refuse(const std::string& szWhy) {
     std::snprintf(Reason(), kMaxReason + 1, "%s", szWhy.c_str());
-    syslog(LOG_ERR, "the router descriptions were not refreshed: %s", szWhy.c_str());
+    tavo::SysLog(LOG_ERR, "the router descriptions were not refreshed: %s", szWhy.c_str());
     return Fail(TLIBC_ERR_READ, __LINE__);
 }
 
@@ -234,7 +234,8 @@ const char* GetRouterDBPath() {
     // that was cut.
     if (std::strpbrk(szLocation, "'\\\n\r") != nullptr || szLocation[0] == '-' ||
         std::strlen(szLocation) == sizeof(szLocation) - 1) {
-        syslog(LOG_ERR, "database_url of [download] in /etc/tavo/platform.conf is no address; nothing is downloaded");
+        tavo::SysLog(LOG_ERR,
+                     "database_url of [download] in /etc/tavo/platform.conf is no address; nothing is downloaded");
         szLocation[0] = '\0';
     }
     return szLocation;

@@ -3,7 +3,6 @@
 // Promises: a list is whole or absent; a file is replaced whole or left alone.
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,6 +14,7 @@
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 #include "portforward/Aside.h"
 #include "portforward/ConfList.h"
 #include "portforward/PortText.h"
@@ -44,7 +44,7 @@ void EmptyOut(const char* szPath) {
     const auto szText = tavo::ReadFile("/proc/self/fd/" + std::to_string(fd.Get()));
     const auto rgSections = szText ? tavo::ParseSections(*szText) : std::nullopt;
     if (rgSections && rgSections->empty() && ftruncate(fd.Get(), 0) != 0) {
-        syslog(LOG_WARNING, "%s holds no section and cannot be emptied", szPath);
+        tavo::SysLog(LOG_WARNING, "%s holds no section and cannot be emptied", szPath);
     }
 }
 
@@ -195,7 +195,7 @@ ConfList LoadConfList(const char* szPath) {
                         std::all_of(rgSections->begin(), rgSections->end(),
                                     [](const Section& section) { return section.szName.size() < TAVO_PF_NAME_SIZE; });
     if (!blFits) {
-        syslog(LOG_ERR, "%s: too many sections, or a name over %d bytes; the file is left alone and not used", szPath,
+        SysLog(LOG_ERR, "%s: too many sections, or a name over %d bytes; the file is left alone and not used", szPath,
                TAVO_PF_NAME_SIZE - 1);
         TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
         return nullptr;

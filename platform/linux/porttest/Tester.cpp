@@ -2,7 +2,6 @@
 // one for each rule. Relies on TestPorts. Promises: see tavo/porttest.h.
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -11,6 +10,7 @@
 
 #include "core/Border.h"
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 #include "portforward/ConfList.h"
 #include "porttest/PortTest.h"
 #include "porttest/RuleVerdict.h"
@@ -113,7 +113,7 @@ int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* r
         for (size_t i = 0; i < rgParts.size(); ++i) {
             Fill(rgStatus[i], PutTogether(rgParts[i], rgQuestions, rgVerdicts));
             // The library passes on the status alone; the reason is for whoever reads the log.
-            syslog(LOG_NOTICE, "port test, rule %zu: %s", i + 1, rgStatus[i].szText);
+            tavo::SysLog(LOG_NOTICE, "port test, rule %zu: %s", i + 1, rgStatus[i].szText);
         }
         return 0;
     });

@@ -4,10 +4,10 @@
 
 #include <netinet/in.h>
 #include <sys/stat.h>
-#include <syslog.h>
 
 #include <memory>
 
+#include "core/SysLog.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
 
@@ -40,7 +40,7 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     TLIBCSzHashSetValue(pHash.get(), "location", router.szLocation.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
     if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
-        syslog(LOG_WARNING, "cannot write %s", kStateFile);
+        SysLog(LOG_WARNING, "cannot write %s", kStateFile);
     }
 }
 

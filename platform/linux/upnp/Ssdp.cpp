@@ -6,7 +6,6 @@
 #include <poll.h>
 #include <strings.h>
 #include <sys/socket.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <chrono>
@@ -14,6 +13,7 @@
 #include <set>
 
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -97,7 +97,7 @@ std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHea
     std::string szReason;
     auto location = LocationOf({szAnswer, static_cast<size_t>(nRead)}, szGateway, szReason);
     if (!location && ++nRefused <= kMaxRefusalsLogged) {
-        syslog(LOG_WARNING, "router's discovery answer refused: %s", szReason.c_str());
+        SysLog(LOG_WARNING, "router's discovery answer refused: %s", szReason.c_str());
     }
     return location;
 }

@@ -24,6 +24,7 @@
 #include "core/Descriptor.h"
 #include "core/OwnFile.h"
 #include "core/RunKeys.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/Instance.h"
 #include "daemons/common/SignalQueue.h"
@@ -71,7 +72,7 @@ constexpr int kPollMilliseconds = 20;
 void WritePidFile(const DaemonNames& names) {
     if (TLIBCReadPidFile(names.szPidFile) != getpid() &&
         !WriteFileAtomic(names.szPidFile, std::to_string(getpid()) + "\n", kPidFileMode)) {
-        syslog(LOG_ERR, "cannot write %s", names.szPidFile);
+        SysLog(LOG_ERR, "cannot write %s", names.szPidFile);
     }
 }
 
@@ -91,7 +92,7 @@ Descriptor Detach() {
     close(rgFd[0]);
     setsid();
     if (chdir("/") != 0) {
-        syslog(LOG_WARNING, "cannot change to /");
+        SysLog(LOG_WARNING, "cannot change to /");
     }
     const Descriptor fdNull(open("/dev/null", O_RDWR | O_CLOEXEC));
     for (int fd = STDIN_FILENO; fdNull.Get() >= 0 && fd <= STDERR_FILENO; ++fd) {
@@ -104,7 +105,7 @@ bool Withdraw(Mapper& mapper) {
     const auto end = Clock::now() + kWithdrawLimit;
     const bool blGone = mapper.Withdraw([end] { return Clock::now() > end; });
     if (!blGone) {
-        syslog(LOG_ERR, "the router could not be asked to take the mappings away; it may keep them");
+        SysLog(LOG_ERR, "the router could not be asked to take the mappings away; it may keep them");
     }
     return blGone;
 }
@@ -155,7 +156,7 @@ bool EndRunning(const DaemonNames& names, int nSignal) {
         return true;
     });
     if (!blEnded) {
-        syslog(LOG_ERR, "the %s that runs does not end (lock %s)", names.szName, names.szLockFile);
+        SysLog(LOG_ERR, "the %s that runs does not end (lock %s)", names.szName, names.szLockFile);
     }
     return blEnded;
 }
@@ -252,7 +253,7 @@ int MakeLockFiles() {
     int nExit = 0;
     for (const char* szPath : kLockFiles) {
         if (!MakeOwnFile(szPath)) {
-            syslog(LOG_ERR, "cannot make %s: %s", szPath, std::strerror(errno));
+            SysLog(LOG_ERR, "cannot make %s: %s", szPath, std::strerror(errno));
             nExit = 1;
         }
     }
@@ -260,7 +261,7 @@ int MakeLockFiles() {
 }
 
 int AnotherRuns(const DaemonNames& names) {
-    syslog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
+    SysLog(LOG_ERR, "another %s is running (lock %s)", names.szName, names.szLockFile);
     return 1;
 }
 
@@ -274,7 +275,7 @@ int RunInstance(Mapper& mapper, Descriptor& fdReady) {
     Frame frame(mapper);
     WritePidFile(names);
     const bool blTold = fdReady.Get() < 0 || write(fdReady.Get(), "r", 1) == 1;
-    syslog(LOG_INFO, "%s begins%s", names.szName, blTold ? "" : " anew");
+    SysLog(LOG_INFO, "%s begins%s", names.szName, blTold ? "" : " anew");
     fdReady.Reset();
     NotifyReady();
     frame.Loop();

@@ -4,7 +4,6 @@
 
 #include <sys/socket.h>
 #include <sys/wait.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -12,6 +11,7 @@
 
 #include "core/Directory.h"
 #include "core/Spawn.h"
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -47,7 +47,7 @@ bool HookQueue::Start() {
     if (nErrno != 0) {
         mPid = -1;
         mFdFacts.Reset();
-        syslog(LOG_ERR, "cannot run %s: %s", kRunner, std::strerror(nErrno));
+        SysLog(LOG_ERR, "cannot run %s: %s", kRunner, std::strerror(nErrno));
     }
     return nErrno == 0;
 }
@@ -70,7 +70,7 @@ void HookQueue::Run(const std::vector<std::string>& rgFacts) {
         szFacts += szFact + '\0';
     }
     if (szFacts.size() > kMaxHookFacts || (mPid < 0 && !Start()) || !Send(szFacts)) {
-        syslog(LOG_WARNING, "a notice was not passed on to the hooks in %s", kHookDirectory);
+        SysLog(LOG_WARNING, "a notice was not passed on to the hooks in %s", kHookDirectory);
     }
 }
 

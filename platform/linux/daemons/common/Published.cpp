@@ -3,9 +3,9 @@
 
 #include <json/json.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -135,7 +135,7 @@ std::string ToJson(const Published& state) {
 void Publish(const Published& state) {
     mkdir(kDirectory, kDirectoryMode);
     if (!WriteFileAtomic(PathOf(state.szDaemon), ToJson(state), kFileMode)) {
-        syslog(LOG_ERR, "cannot write %s", PathOf(state.szDaemon).c_str());
+        SysLog(LOG_ERR, "cannot write %s", PathOf(state.szDaemon).c_str());
     }
 }
 

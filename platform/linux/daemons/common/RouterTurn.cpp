@@ -4,10 +4,10 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/file.h>
-#include <syslog.h>
 
 #include <utility>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -25,7 +25,7 @@ bool RouterTurn::Take(const std::function<bool()>& fnWait) {
     }
     Descriptor fd(open(kTurnFile, O_RDWR | O_CREAT | O_CLOEXEC, kPrivateMode));
     if (fd.Get() < 0) {
-        syslog(LOG_ERR, "cannot open %s", kTurnFile);
+        SysLog(LOG_ERR, "cannot open %s", kTurnFile);
         return false;
     }
     while (flock(fd.Get(), LOCK_EX | LOCK_NB) != 0) {

@@ -2,7 +2,6 @@
 // Promises: see RuleMapper.h.
 #include "daemons/common/RuleMapper.h"
 
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -10,6 +9,7 @@
 #include <ctime>
 #include <utility>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "net/Neighbour.h"
 #include "tavo/core.h"
@@ -76,7 +76,7 @@ void RuleMapper::ReadRules() {
     } else {
         mWanted.blReadable = false;
         mWanted.blSwitchedOn = wanted.blSwitchedOn;
-        syslog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
+        SysLog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
     }
 }
 
@@ -212,7 +212,7 @@ void RuleMapper::WriteResults(const OutcomeList& rgOutcomes) const {
     const std::string szText = ResultText(rgAll);
     // A box that has nothing to do lets its disks sleep.
     if (ReadFile(mNames.szResultFile) != szText && !WriteFileAtomic(mNames.szResultFile, szText, kResultMode)) {
-        syslog(LOG_ERR, "cannot write %s", mNames.szResultFile);
+        SysLog(LOG_ERR, "cannot write %s", mNames.szResultFile);
     }
 }
 

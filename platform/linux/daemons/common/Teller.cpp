@@ -1,10 +1,9 @@
 // One notice, told everywhere. Relies on the event log's catalogue for its words. Promises: see Teller.h.
 #include "daemons/common/Teller.h"
 
-#include <syslog.h>
-
 #include <utility>
 
+#include "core/SysLog.h"
 #include "log/Catalogue.h"
 #include "tavo/log.h"
 
@@ -73,10 +72,10 @@ std::vector<std::string> HookFacts(const Notice& notice, const Published& state)
 
 void Teller::Tell(const Notice& notice, const Published& state) {
     const Kind& kind = KindOf(notice.enChange);
-    syslog(kind.blWorse ? LOG_WARNING : LOG_NOTICE, "%s", SentenceOf(notice).c_str());
+    SysLog(kind.blWorse ? LOG_WARNING : LOG_NOTICE, "%s", SentenceOf(notice).c_str());
     if (TAVOLogSet1(kSystemEvents, kind.blWorse ? kWarning : kInformation, kind.nEvent, notice.szText.c_str(), nullptr,
                     nullptr, nullptr) != 0) {
-        syslog(LOG_ERR, "the event log could not be written");
+        SysLog(LOG_ERR, "the event log could not be written");
     }
     mHooks.Run(HookFacts(notice, state));
 }

@@ -2,7 +2,6 @@
 #include "daemons/common/ToldFile.h"
 
 #include <sys/stat.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <array>
@@ -10,6 +9,7 @@
 #include <string_view>
 #include <utility>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -144,7 +144,7 @@ void ToldFile::Save() {
     }
     mkdir(kStateDir, 0755);
     if (!WriteFileAtomic(mSzPath, szText)) {
-        syslog(LOG_ERR, "cannot write %s: what was told may be told again", mSzPath.c_str());
+        SysLog(LOG_ERR, "cannot write %s: what was told may be told again", mSzPath.c_str());
         return;
     }
     mSzWritten = std::move(szText);

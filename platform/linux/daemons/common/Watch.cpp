@@ -3,12 +3,13 @@
 
 #include <sys/prctl.h>
 #include <sys/wait.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <deque>
+
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -79,7 +80,7 @@ bool Watch::Pause() {
 
 int Watch::Run(const std::function<int()>& fnWork) {
     if (!mInstance.Take()) {
-        syslog(LOG_ERR, "another process watches over %s (lock %s)", mSzName, mInstance.LockFile().c_str());
+        SysLog(LOG_ERR, "another process watches over %s (lock %s)", mSzName, mInstance.LockFile().c_str());
         return 1;
     }
     std::deque<Clock::time_point> crashes;
@@ -98,9 +99,9 @@ int Watch::Run(const std::function<int()>& fnWork) {
         while (crashes.front() < Clock::now() - kCrashWindow) {
             crashes.pop_front();
         }
-        syslog(LOG_ERR, "%s was ended by signal %d", mSzName, WTERMSIG(nStatus));
+        SysLog(LOG_ERR, "%s was ended by signal %d", mSzName, WTERMSIG(nStatus));
         if (mSignals.IsStop() || crashes.size() >= kMostCrashes) {
-            syslog(LOG_ERR, "%s is not started again", mSzName);
+            SysLog(LOG_ERR, "%s is not started again", mSzName);
             return 1;
         }
         if (!Pause()) {

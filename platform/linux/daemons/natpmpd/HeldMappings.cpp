@@ -3,11 +3,11 @@
 #include "daemons/natpmpd/HeldMappings.h"
 
 #include <sys/stat.h>
-#include <syslog.h>
 
 #include <cstdlib>
 #include <vector>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/BootClock.h"
 #include "mapping/Pass.h"
@@ -79,7 +79,7 @@ void HeldMappings::Save() {
     }
     mkdir(kStateDir, 0755);
     if (!WriteFileAtomic(kStateFile, szText)) {
-        syslog(LOG_ERR, "cannot write %s: mappings may outlive a crash until they run out", kStateFile);
+        SysLog(LOG_ERR, "cannot write %s: mappings may outlive a crash until they run out", kStateFile);
         return;
     }
     mSzWritten = std::move(szText);

@@ -5,12 +5,13 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
-#include <syslog.h>
 
 #include <cerrno>
 #include <cstring>
 #include <string_view>
 #include <utility>
+
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -41,7 +42,7 @@ Descriptor ListenForAnnouncements() {
     group.sin_port = htons(kAnnouncementPort);
     group.sin_addr.s_addr = htonl(INADDR_ALLHOSTS_GROUP);
     if (bind(fd.Get(), reinterpret_cast<sockaddr*>(&group), sizeof(group)) != 0) {
-        syslog(LOG_WARNING, "a router that restarts is noticed at the next check only: %s", std::strerror(errno));
+        SysLog(LOG_WARNING, "a router that restarts is noticed at the next check only: %s", std::strerror(errno));
         return Descriptor();
     }
     return fd;

@@ -2,10 +2,9 @@
 // Relies on NatpmpClient. Promises: see NatpmpPass.h.
 #include "daemons/natpmpd/NatpmpPass.h"
 
-#include <syslog.h>
-
 #include <algorithm>
 
+#include "core/SysLog.h"
 #include "daemons/common/Wanted.h"
 
 namespace tavo {
@@ -129,7 +128,7 @@ PassResult NatpmpPass::Run(const std::vector<RouterMapping>& rgWanted, bool blRe
     const bool blRestarted = mState.epoch.TakeRestart();
     mBlLost = blRestarted;
     if (blRestarted) {
-        syslog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
+        SysLog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
         std::erase_if(mState.held.mRows, [this](const auto& row) {
             return row.first.szGateway == mSzGateway && row.first.szBox != mSzBox;
         });
@@ -249,7 +248,7 @@ Verdict NatpmpPass::HandBack(const RouterMapping& wanted) {
     }
     mState.held.mRows.erase(key);
     mState.mapRemapped[MappingName(wanted)] = szWords;
-    syslog(LOG_WARNING, "%s: %s; given back", MappingName(wanted).c_str(), szWords.c_str());
+    SysLog(LOG_WARNING, "%s: %s; given back", MappingName(wanted).c_str(), szWords.c_str());
     return {PortState::kRefused, szWords};
 }
 

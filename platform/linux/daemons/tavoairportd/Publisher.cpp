@@ -8,7 +8,6 @@
 #include <signal.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -17,6 +16,7 @@
 #include <vector>
 
 #include "core/Border.h"
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -114,7 +114,7 @@ void AirportPublisher::OnClient(AvahiClient* pClient, AvahiClientState enState, 
             // A restarted avahi knows nothing of what we asked the old one. A new client cannot be made
             // within the old one's callback.
             const bool blRestarted = avahi_client_errno(pClient) == AVAHI_ERR_DISCONNECTED;
-            syslog(blRestarted ? LOG_INFO : LOG_ERR, "connection to avahi: %s",
+            SysLog(blRestarted ? LOG_INFO : LOG_ERR, "connection to avahi: %s",
                    avahi_strerror(avahi_client_errno(pClient)));
             self.SetTimer(self.mPConnectTimer, blRestarted ? 0 : kRetryMilliseconds,
                           [](AvahiTimeout*, void* pData) { Self(pData).Connect(); });
@@ -130,7 +130,7 @@ void AirportPublisher::Browse(AvahiClient* pClient) {
     mPBrowser.reset(avahi_service_browser_new(pClient, AVAHI_IF_UNSPEC, AVAHI_PROTO_INET, kServiceType, kDomain,
                                               static_cast<AvahiLookupFlags>(0), &OnBrowse, this));
     if (!mPBrowser) {
-        syslog(LOG_ERR, "cannot browse %s: %s", kServiceType, avahi_strerror(avahi_client_errno(pClient)));
+        SysLog(LOG_ERR, "cannot browse %s: %s", kServiceType, avahi_strerror(avahi_client_errno(pClient)));
         SetTimer(mPConnectTimer, kRetryMilliseconds, [](AvahiTimeout*, void* pUser) { Self(pUser).Connect(); });
     }
 }
@@ -217,7 +217,7 @@ void AirportPublisher::Write() const {
     }
     RemoveForeign(mSzPath);
     if (!WriteFileAtomic(mSzPath, FormatSections(rgSections), kListMode)) {
-        syslog(LOG_ERR, "cannot write %s: %s", mSzPath.c_str(), std::strerror(errno));
+        SysLog(LOG_ERR, "cannot write %s: %s", mSzPath.c_str(), std::strerror(errno));
     }
 }
 

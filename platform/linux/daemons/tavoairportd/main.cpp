@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "core/Descriptor.h"
+#include "core/SysLog.h"
 #include "daemons/tavoairportd/Publisher.h"
 
 namespace {
@@ -32,7 +33,7 @@ int main(int argc, char** argv) {
     // A second one would take the list of the first away when it ends.
     const tavo::Descriptor fdLock(open(kLock, O_RDWR | O_CREAT | O_CLOEXEC, 0600));
     if (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
-        syslog(LOG_ERR, "another tavoairportd is running (lock %s)", kLock);
+        tavo::SysLog(LOG_ERR, "another tavoairportd is running (lock %s)", kLock);
         return 1;
     }
     tavo::AirportPublisher publisher(kList);

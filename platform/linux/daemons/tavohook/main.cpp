@@ -15,6 +15,7 @@
 #include <string>
 #include <string_view>
 
+#include "core/SysLog.h"
 #include "daemons/common/HookQueue.h"
 #include "daemons/common/SignalQueue.h"
 #include "daemons/tavohook/Hooks.h"
@@ -54,7 +55,7 @@ int Runner::RunAll(const std::vector<std::string>& rgFacts) {
     const std::vector<std::string> rgszHooks = tavo::FindHooks(tavo::kHookDirectory, rgszRefused);
     for (const std::string& szRefused : rgszRefused) {
         if (mSetRefused.insert(szRefused).second) {
-            syslog(LOG_WARNING, "not run: %s", szRefused.c_str());
+            tavo::SysLog(LOG_WARNING, "not run: %s", szRefused.c_str());
         }
     }
     int nFailed = 0;
@@ -65,15 +66,15 @@ int Runner::RunAll(const std::vector<std::string>& rgFacts) {
         const tavo::HookEnd end = tavo::RunHook(std::string(tavo::kHookDirectory) + "/" + szName, rgFacts, kHookLimit,
                                                 [this] { return mSignals.IsStop(); });
         if (mSignals.IsStop()) {
-            syslog(LOG_WARNING, "hook %s: ended because tavohook was told to end", szName.c_str());
+            tavo::SysLog(LOG_WARNING, "hook %s: ended because tavohook was told to end", szName.c_str());
         } else if (!end.blStarted) {
-            syslog(LOG_ERR, "hook %s: it could not be started", szName.c_str());
+            tavo::SysLog(LOG_ERR, "hook %s: it could not be started", szName.c_str());
         } else if (!end.blInTime) {
-            syslog(LOG_WARNING, "hook %s: ended because it took longer than 30 seconds", szName.c_str());
+            tavo::SysLog(LOG_WARNING, "hook %s: ended because it took longer than 30 seconds", szName.c_str());
         } else if (end.nStatus != 0) {
-            syslog(LOG_WARNING, "hook %s: ended with %d: %s", szName.c_str(), end.nStatus, end.szOutput.c_str());
+            tavo::SysLog(LOG_WARNING, "hook %s: ended with %d: %s", szName.c_str(), end.nStatus, end.szOutput.c_str());
         } else {
-            syslog(LOG_DEBUG, "hook %s: done", szName.c_str());
+            tavo::SysLog(LOG_DEBUG, "hook %s: done", szName.c_str());
             continue;
         }
         ++nFailed;

@@ -3,7 +3,6 @@
 #include "daemons/tavoportcheckd/Connection.h"
 
 #include <poll.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <chrono>
@@ -12,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "core/SysLog.h"
 #include "daemons/tavoportcheckd/HttpRequest.h"
 #include "daemons/tavoportcheckd/Prober.h"
 #include "porttest/Protocol.h"
@@ -288,7 +288,7 @@ void Connection::Serve(int fd) {
     }
     if (reply) {
         Send(socket, *reply);
-        syslog(LOG_INFO, "%s: HTTP %d%s", (mAsker ? *mAsker : mPeer).Text().c_str(), reply->enCode, mSzNote.c_str());
+        SysLog(LOG_INFO, "%s: HTTP %d%s", (mAsker ? *mAsker : mPeer).Text().c_str(), reply->enCode, mSzNote.c_str());
         socket.Finish();
     }
 }

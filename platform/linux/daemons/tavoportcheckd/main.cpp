@@ -18,6 +18,7 @@
 #include <system_error>
 #include <thread>
 
+#include "core/SysLog.h"
 #include "daemons/tavoportcheckd/Connection.h"
 
 namespace {
@@ -115,7 +116,7 @@ void Clients::Take(Descriptor fd, const Address& peer) {
             try {
                 ServeConnection(std::move(fdClient), peer, mState);
             } catch (const std::exception&) {
-                syslog(LOG_ERR, "%s: no memory to serve it", peer.Text().c_str());
+                tavo::SysLog(LOG_ERR, "%s: no memory to serve it", peer.Text().c_str());
             }
             Leave(peer);
         }).detach();

@@ -2,11 +2,11 @@
 #include "daemons/tavoportforward/Made.h"
 
 #include <sys/stat.h>
-#include <syslog.h>
 
 #include <algorithm>
 #include <charconv>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "tavo/core.h"
 
@@ -41,7 +41,7 @@ MadeJobs::MadeJobs(std::string szGateway, std::string szBox)
     const auto szText = ReadFile(kRecord);
     const auto rgSections = szText ? ParseSections(*szText) : std::nullopt;
     if (!rgSections) {
-        syslog(LOG_ERR, "%s cannot be read: mappings made earlier are not known by it", kRecord);
+        SysLog(LOG_ERR, "%s cannot be read: mappings made earlier are not known by it", kRecord);
         return;
     }
     for (const Section& section : *rgSections) {
@@ -95,7 +95,7 @@ bool MadeJobs::Write() const {
     mkdir(kDirectory, kDirectoryMode);
     const bool blWritten = WriteFileAtomic(kRecord, FormatSections(rgSections));
     if (!blWritten) {
-        syslog(LOG_ERR, "cannot write %s", kRecord);
+        SysLog(LOG_ERR, "cannot write %s", kRecord);
     }
     return blWritten;
 }

@@ -2,11 +2,10 @@
 // Promises: see Telling.h.
 #include "daemons/tavoportforward/Telling.h"
 
-#include <syslog.h>
-
 #include <algorithm>
 #include <ctime>
 
+#include "core/SysLog.h"
 #include "daemons/common/Published.h"
 #include "daemons/common/Wanted.h"
 #include "portforward/ConfList.h"
@@ -32,7 +31,7 @@ void AddEvent(const std::string& szWhat, const std::string& szWhy) {
 void Log(const std::vector<Refusal>& rgRefusals) {
     std::vector<std::pair<std::string, std::string>> rgEvents;  // reason, what it holds for
     for (const Refusal& refusal : rgRefusals) {
-        syslog(LOG_ERR, "%s: %s", refusal.szWhat.c_str(), refusal.szWhy.c_str());
+        SysLog(LOG_ERR, "%s: %s", refusal.szWhat.c_str(), refusal.szWhy.c_str());
         const auto it = std::find_if(rgEvents.begin(), rgEvents.end(),
                                      [&](const auto& event) { return event.first == refusal.szWhy; });
         if (it == rgEvents.end()) {
@@ -122,7 +121,7 @@ void Tell(const RunResult& result) {
 }
 
 void TellNotTried(RunResult result, const std::string& szWhy) {
-    syslog(LOG_ERR, "nothing was tried: %s", szWhy.c_str());
+    SysLog(LOG_ERR, "nothing was tried: %s", szWhy.c_str());
     const ConfList pRules(TAVOPFRuleGet());
     result.blRulesReadable =
         pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCErrGet() == TLIBC_ERR_NOT_FOUND;

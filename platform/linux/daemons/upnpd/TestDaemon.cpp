@@ -17,6 +17,7 @@
 #include <chrono>
 #include <cstdio>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/Wanted.h"
 #include "daemons/common/Watch.h"
@@ -57,7 +58,7 @@ void Log(const std::string& szText) {
 // A progress file that was taken away belongs to a test that is over: it is not made anew.
 void Report(const char* szStep, const char* szWord) {
     if (TLIBCFileExist(kTestProgress) == 1 && TAVOUpnpReportTestProgress(szStep, szWord, 0) != 0) {
-        syslog(LOG_ERR, "cannot report %s of %s", szWord, szStep);
+        SysLog(LOG_ERR, "cannot report %s of %s", szWord, szStep);
     }
 }
 
@@ -181,7 +182,7 @@ void TestDaemon::WriteResults() const {
         szText += std::to_string(rule.nRouterPort) + "/tcp=" + rule.szResult + "\n";
     }
     if (!SaveTestRules(mPMappings->Rules()) || !WriteFileAtomic(kUpnpResults, szText, kResultMode)) {
-        syslog(LOG_ERR, "cannot write the results of the test");
+        SysLog(LOG_ERR, "cannot write the results of the test");
     }
 }
 
@@ -234,7 +235,7 @@ bool TestDaemon::Withdraw() {
 void TestDaemon::End() {
     const bool blGone = mPMappings == nullptr || Withdraw();
     if (!blGone) {
-        syslog(LOG_ERR, "the router did not take all test mappings away; the next test tries it again");
+        SysLog(LOG_ERR, "the router did not take all test mappings away; the next test tries it again");
     }
     RemoveTestRules();
     unlink(kTestSocket);
@@ -267,7 +268,7 @@ int TestDaemon::RunTest() {
         setrlimit(RLIMIT_NOFILE, &limit);
     }
     if (!TakeLock()) {
-        syslog(LOG_ERR, "another test is running (lock %s)", kLockFile);
+        SysLog(LOG_ERR, "another test is running (lock %s)", kLockFile);
         Report(kStepAdd, kWordFailed);
         return 1;
     }
@@ -286,7 +287,7 @@ int TestDaemon::WatchOver(pid_t pid) {
     if (nStatus >= 0 && WIFEXITED(nStatus)) {
         return WEXITSTATUS(nStatus);
     }
-    syslog(LOG_ERR, "the test was killed; its mappings are taken away");
+    SysLog(LOG_ERR, "the test was killed; its mappings are taken away");
     if (TakeLock() && FindRouter()) {
         End();
     }
