@@ -57,8 +57,7 @@ __TAG_TAVO_ROUTER_INIT_STATE CachedState(const std::string& szGateway) {
     if (!DetectCache::IsCacheExisted() || reader.IsSectionExisted(blExisted) == 0 || !blExisted) {
         return TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED;
     }
-    reader.GetType(enState);
-    return enState;
+    return reader.GetType(enState) != 0 ? enState : TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED;
 }
 
 // A router of which detection could not tell whether its UPnP works: the recorded test can.

@@ -19,7 +19,7 @@ bool ToSupport(__tag_TAVO_ROUTER_SUPPORT& enSupport, const char* szSupport) {
     return true;
 }
 
-// A section whose state cannot be read says nothing: unknown.
+// A section whose state is missing or makes no sense counts as absent: only a new detection can replace it.
 State FromCache(const std::string& szGateway) {
     DetectCacheReader reader(szGateway);
     bool blExisted = false;
@@ -27,8 +27,7 @@ State FromCache(const std::string& szGateway) {
         return TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED;
     }
     State enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
-    reader.GetType(enState);
-    return enState;
+    return reader.GetType(enState) != 0 ? enState : TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED;
 }
 
 // A router whose UPnP nobody could tell: the verdict of the compatibility test.

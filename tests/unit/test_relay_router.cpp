@@ -227,7 +227,7 @@ TEST_F(RelayRouter, InitState) {
         {"", "", false, 0, 1, {}},
         {"", "[10.0.0.1]\nrouter_detect=manual\n", false, 0, 1, {}},
         {"", "[192.168.1.1]\nrouter_detect=manual\n", false, 0, 3, {}},
-        {"", "[192.168.1.1]\nrouter_detect=Manual\n", false, 0, 0, {"invalid szValue=Manual"}},
+        {"", "[192.168.1.1]\nrouter_detect=Manual\n", false, 0, 1, {"invalid szValue=Manual"}},
     };
     for (const auto& c : rgCases) {
         SetUp();

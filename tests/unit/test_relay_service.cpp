@@ -269,8 +269,16 @@ TEST_F(RelayService, EachStepThatFails) {
              std::filesystem::remove(kRouterConf);
              Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"odd\"\n");
          },
+         1,
+         {"invalid szValue=odd", "Not initialized portforwarding"},
+         false},
+        {"a cache of the unknown",
+         [] {
+             std::filesystem::remove(kRouterConf);
+             Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n");
+         },
          -1,
-         {"invalid szValue=odd", "failed, state is unknown"},
+         {"failed, state is unknown"},
          false},
         {"a manual router",
          [] { Write(kRouterConf, Conf("R1", "no", "no")); },
@@ -452,6 +460,11 @@ TEST_F(RelayService, ClassifiesTheRouterOnce) {
          "manual a/b/c;"},
         {"an odd cache",
          [] { Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nbrand=\"a\"\n"); },
+         0,
+         {"can not read router sdk version", "upgrade db fail"},
+         "settings yes no;"},
+        {"a cache of the unknown",
+         [] { Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n"); },
          -1,
          {"TLibTavoPortMapRouterDetect() failed, state=0"},
          ""},
