@@ -109,8 +109,18 @@ bool IsReadFailure(int nErr) {
     return nErr == TLIBC_ERR_NO_MEMORY || nErr == TLIBC_ERR_OPEN || nErr == TLIBC_ERR_READ;
 }
 
+// Whether there are settings. A writer of pages that lives has them aside for a moment: the platform's reader waits for
+// it, and "nothing" must not be said before it has looked.
+bool IsStored() {
+    if (TLIBCFileExist(kRouterConf) == 1) {
+        return true;
+    }
+    const tavo::lib::ConfList pList(TAVOPFGwRouterConfGet());
+    return pList != nullptr || TLIBCFileExist(kRouterConf) == 1;
+}
+
 int FillRouterConf(const char* szGwRouterIP, RouterConf& conf) {
-    if (TLIBCFileExist(kRouterConf) != 1) {
+    if (!IsStored()) {
         LogError("%s:%d file=%s not exists", kEntryFile, __LINE__, kRouterConf);
         return kNothingStored;
     }

@@ -333,6 +333,32 @@ TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
     EXPECT_EQ(Read(kRouterConf), kOldSettings);
 }
 
+TEST_F(Faults, ReadersNeverSeeNoSettingsWhileSomebodyWrites) {
+    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
+    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
+    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=1'\n");
+    chmod("/usr/tavo/bin/tavoportforward", 0755);
+    for (const char* szSupport : {"no", "yes"}) {
+        Write(kRouterConf, kOldSettings);
+        const pid_t pid = fork();
+        if (pid == 0) {
+            for (int i = 0; i < 100; ++i) {
+                CallAndDie({"", szSupport, 1, true});
+            }
+            _exit(0);
+        }
+        const auto pConf = std::make_unique<RouterConf>();
+        int nReads = 0;
+        int nNothing = 0;
+        for (; waitpid(pid, nullptr, WNOHANG) == 0; ++nReads) {
+            nNothing += TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false) != 0 ? 1 : 0;
+        }
+        EXPECT_GT(nReads, 10);
+        EXPECT_EQ(nNothing, 0) << szSupport << ", of " << nReads;
+        EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"}));
+    }
+}
+
 TEST_F(Faults, RulesLeftAsideAreNotNoRules) {
     for (const char* szOwn : {"rule.conf.saved", "rule.confbackup", "rule.conf202401", "rule.confOld001",
                               "rule.conf.aB3dE6", "rule.conf.bak"}) {
