@@ -4,9 +4,10 @@
 #include <linux/rtnetlink.h>
 #include <netlink/socket.h>
 #include <sys/socket.h>
-#include <syslog.h>
 
 #include <cerrno>
+
+#include "core/SysLog.h"
 
 namespace tavo {
 
@@ -22,7 +23,7 @@ NetworkWatch::NetworkWatch() : mPSocket(Connect()) {
         mPSocket.reset();
     }
     if (!mPSocket) {
-        syslog(LOG_WARNING, "a change of the network is noticed at the next check only");
+        SysLog(LOG_WARNING, "a change of the network is noticed at the next check only");
     }
 }
 

@@ -5,11 +5,11 @@
 #include <netinet/in.h>
 #include <strings.h>
 #include <sys/socket.h>
-#include <syslog.h>
 
 #include <cerrno>
 #include <cstring>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
@@ -59,7 +59,7 @@ void Announcements::Listen(const std::string& szLocal) {
     if (inet_pton(AF_INET, szLocal.c_str(), &membership.imr_interface) != 1 ||
         bind(mFd.Get(), reinterpret_cast<const sockaddr*>(&group), sizeof(group)) != 0 ||
         setsockopt(mFd.Get(), IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof(membership)) != 0) {
-        syslog(LOG_WARNING, "a router that restarts is noticed at the next check only: %s", std::strerror(errno));
+        SysLog(LOG_WARNING, "a router that restarts is noticed at the next check only: %s", std::strerror(errno));
         mFd.Reset();
     }
 }

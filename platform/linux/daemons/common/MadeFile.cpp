@@ -2,8 +2,8 @@
 #include "daemons/common/MadeFile.h"
 
 #include <sys/stat.h>
-#include <syslog.h>
 
+#include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/BootClock.h"
 
@@ -25,7 +25,7 @@ void MadeFile::Save() {
     }
     mkdir(kStateDir, 0755);
     if (!WriteFileAtomic(mSzPath, szText)) {
-        syslog(LOG_ERR, "cannot write %s: mappings may outlive a crash", mSzPath);
+        SysLog(LOG_ERR, "cannot write %s: mappings may outlive a crash", mSzPath);
         return;
     }
     mSzWritten = std::move(szText);
