@@ -194,14 +194,19 @@ private:
 // Until the clock, a signal, a new file in the marker's directory or a word from the router.
 void Frame::Wait() {
     const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mNext - Clock::now()).count() + 1;
-    pollfd rgWaiting[] = {
-        mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mMapper.WakeFd(), POLLIN, 0}, {mNetwork.Fd(), POLLIN, 0}};
+    std::vector<pollfd> rgWaiting = {mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mNetwork.Fd(), POLLIN, 0}};
+    const auto nOurs = static_cast<std::ptrdiff_t>(rgWaiting.size());
+    for (const int fd : mMapper.WakeFds()) {
+        rgWaiting.push_back({fd, POLLIN, 0});
+    }
     mSignals.Wait(rgWaiting, static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
     alignas(inotify_event) char szEvents[4096];
     while (read(mFdEvents.Get(), szEvents, sizeof(szEvents)) > 0) {
     }
-    const bool blRouter = rgWaiting[2].revents != 0 && mMapper.OnWake();
-    const bool blNetwork = rgWaiting[3].revents != 0 && mNetwork.TakeChange() && mMapper.OnNetworkChange();
+    const bool blSpoke = std::any_of(rgWaiting.begin() + nOurs, rgWaiting.end(),
+                                     [](const pollfd& waiting) { return waiting.revents != 0; });
+    const bool blRouter = blSpoke && mMapper.OnWake();
+    const bool blNetwork = rgWaiting[2].revents != 0 && mNetwork.TakeChange() && mMapper.OnNetworkChange();
     const auto early = std::max(Clock::now() + kSettle, mWoken + kLeastPause);
     if ((blRouter || blNetwork) && early < mNext) {
         mNext = early;

@@ -7,6 +7,7 @@
 
 #include <functional>
 #include <string>
+#include <vector>
 
 namespace tavo {
 
@@ -31,10 +32,10 @@ public:
     virtual bool IsSwitchedOn() const = 0;
     // Takes away every mapping that we made. False: some may be left in the router.
     virtual bool Withdraw(const std::function<bool()>& fnStop) = 0;
-    // A descriptor on which the router may speak of its own accord, or -1; and, when it did, whether
-    // what it said is a reason for a pass now.
-    virtual int WakeFd() const { return -1; }
-    virtual bool OnWake() { return false; }
+    // The descriptors on which the router may speak of its own accord; and, when it did, whether what it said is a
+    // reason for a pass now. That is only a hint: the pass asks the router itself.
+    virtual std::vector<int> WakeFds() const = 0;
+    virtual bool OnWake() = 0;
     // Whether what has changed of this box's network is a reason for a pass.
     virtual bool OnNetworkChange() = 0;
 };

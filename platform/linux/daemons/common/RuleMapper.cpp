@@ -95,6 +95,9 @@ bool RuleMapper::FindGateway() {
         mNLease = 0;
         mNUntilOutside = 0;
         mSzOutside.clear();
+        if (blFound) {
+            mAnnouncements.Listen(mSzBox);
+        }
         NewGateway();
     }
     return blFound;

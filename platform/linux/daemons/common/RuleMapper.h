@@ -19,6 +19,7 @@
 #include "daemons/common/ToldFile.h"
 #include "daemons/common/Wanted.h"
 #include "mapping/Pass.h"
+#include "upnp/Notify.h"
 
 namespace tavo {
 
@@ -29,6 +30,9 @@ public:
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
     bool Withdraw(const std::function<bool()>& fnStop) final;
     bool OnNetworkChange() final;
+    std::vector<int> WakeFds() const override { return {mAnnouncements.Fd()}; }
+    // The gateway has begun anew, by what it announces as a UPnP device, which most are whatever maps ports there.
+    bool OnWake() override { return mAnnouncements.TakeNews(mSzGateway); }
 
 protected:
     // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked
@@ -76,6 +80,7 @@ private:
     WantedSet mWanted;
     bool mBlRulesRead = false;
     bool mBlMended = false;  // no killed save or detection has left our run key off
+    Announcements mAnnouncements;
     std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
     RouterTurn mTurn;
     std::string mSzGateway;

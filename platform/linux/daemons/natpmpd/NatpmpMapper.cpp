@@ -62,9 +62,9 @@ void NatpmpMapper::NewGateway() {
     }
 }
 
-// An announcement is only a hint: the pass that follows asks the gateway itself.
 bool NatpmpMapper::OnWake() {
-    bool blRestart = false;
+    bool blRestart = RuleMapper::OnWake();
+    mState.blDoubtful = mState.blDoubtful || blRestart;  // its clock may not show it
     uint8_t rgBytes[kAnnouncementSize];
     sockaddr_in sender = {};
     socklen_t nLength = sizeof(sender);

@@ -14,7 +14,11 @@ namespace tavo {
 class NatpmpMapper : public RuleMapper {
 public:
     NatpmpMapper();
-    int WakeFd() const override { return mFdAnnouncements.Get(); }
+    std::vector<int> WakeFds() const override {
+        std::vector<int> rgFds = RuleMapper::WakeFds();
+        rgFds.push_back(mFdAnnouncements.Get());
+        return rgFds;
+    }
     bool OnWake() override;
 
 private:

@@ -22,7 +22,6 @@ constexpr int kOutsideMilliseconds = 2000;
 UpnpMapper::UpnpMapper() : RuleMapper(kNames, false), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
-    mAnnouncements.Listen(Box());
     mPIgd.reset();
     KnownRouter known = RecallRouter(Gateway());
     mSzLocation = std::move(known.szLocation);

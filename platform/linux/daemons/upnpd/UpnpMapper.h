@@ -9,17 +9,12 @@
 #include "daemons/common/RuleMapper.h"
 #include "mapping/Carry.h"
 #include "upnp/Igd.h"
-#include "upnp/Notify.h"
 
 namespace tavo {
 
 class UpnpMapper : public RuleMapper {
 public:
     UpnpMapper();
-
-    int WakeFd() const override { return mAnnouncements.Fd(); }
-    // An announcement is only a hint: the pass that follows asks the router itself.
-    bool OnWake() override { return mAnnouncements.TakeNews(Gateway()); }
 
 private:
     PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
@@ -37,7 +32,6 @@ private:
     std::unique_ptr<Igd> mPIgd;
     LeaseHabit mHabit;
     MadeFile mMade;
-    Announcements mAnnouncements;
 };
 
 }  // namespace tavo
