@@ -164,6 +164,43 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
     EXPECT_EQ(pFirst->mNPosts, 0);
 }
 
+// A table of which each index shows the next of these entries.
+class Table : public Canned {
+public:
+    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string&) override {
+        if (mRgEntries.empty()) {
+            return {tavo::HttpEnd::kAnswered, 500, "<e><Body><Fault><errorCode>713</errorCode></Fault></Body></e>"};
+        }
+        const auto [nPort, szClient] = mRgEntries.front();
+        mRgEntries.erase(mRgEntries.begin());
+        return {tavo::HttpEnd::kAnswered, 200,
+                "<e><Body><r><NewExternalPort>" + std::to_string(nPort) +
+                    "</NewExternalPort><NewProtocol>TCP</NewProtocol><NewInternalPort>5</NewInternalPort>"
+                    "<NewInternalClient>" +
+                    szClient + "</NewInternalClient></r></Body></e>"};
+    }
+    std::vector<std::pair<int, std::string>> mRgEntries;
+};
+
+// Some keep several entries for one port, for different hosts outside; and an entry that is made while the table is
+// read moves the others. Neither is the end of the table.
+TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
+    const std::string szOne = "192.168.1.5";
+    const std::string szTwo = "192.168.1.9";
+    const std::tuple<std::vector<std::pair<int, std::string>>, int, size_t> rgCases[] = {
+        {{{1, szOne}, {2, szOne}}, tavo::kRouterOk, 2},
+        {{{1, szOne}, {1, szTwo}, {2, szOne}}, tavo::kRouterOk, 2},
+        {{{1, szOne}, {1, szOne}, {2, szOne}}, tavo::kRouterTooLong, 1}};
+    for (const auto& [rgEntries, nCode, nShown] : rgCases) {
+        const auto pHttp = std::make_shared<Table>();
+        pHttp->mRgEntries = rgEntries;
+        std::vector<RouterMapping> rgMappings;
+        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->List(rgMappings), nCode);
+        EXPECT_EQ(rgMappings.size(), nShown);
+        EXPECT_EQ(rgMappings.at(0).szClient, szOne);
+    }
+}
+
 TEST(Notify, ALifeIsANumberOrAPlace) {
     const std::pair<const char*, std::optional<std::string>> rgCases[] = {
         {"NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nLocation: http://192.168.1.1:5000/\r\nBOOTID.UPNP.ORG: 7\r\n\r\n",

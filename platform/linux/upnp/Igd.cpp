@@ -9,7 +9,7 @@
 #include <charconv>
 #include <chrono>
 #include <cstring>
-#include <set>
+#include <map>
 
 #include "core/TextFile.h"
 #include "upnp/Ssdp.h"
@@ -357,7 +357,7 @@ int Igd::ExternalAddress(std::string& szAddress) {
 int Igd::List(std::vector<RouterMapping>& rgMappings) {
     const auto end = std::chrono::steady_clock::now() + kListLimit;
     std::vector<RouterMapping> rgRead;
-    std::set<std::pair<std::string, uint16_t>> setSeen;
+    std::map<std::pair<std::string, uint16_t>, size_t> mapSeen;
     for (int i = 0; i < kMaxEntries; ++i) {
         if (std::chrono::steady_clock::now() > end) {
             rgMappings = std::move(rgRead);
@@ -375,8 +375,17 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
         if (mapping.szProtocol.empty()) {
             continue;
         }
-        if (!setSeen.emplace(mapping.szProtocol, mapping.nRouterPort).second) {
-            break;  // a router that ignores the index would go on for ever
+        const auto [it, blNew] = mapSeen.try_emplace({mapping.szProtocol, mapping.nRouterPort}, rgRead.size());
+        if (!blNew) {
+            // A router that ignores the index would go on for ever, and one whose table has grown meanwhile shows the
+            // same once more: either way this is not the whole table. Another entry of the port is for one host
+            // outside.
+            const RouterMapping& seen = rgRead[it->second];
+            if (seen.szClient == mapping.szClient && seen.nBoxPort == mapping.nBoxPort) {
+                rgMappings = std::move(rgRead);
+                return kRouterTooLong;
+            }
+            continue;
         }
         rgRead.push_back(std::move(mapping));
     }
