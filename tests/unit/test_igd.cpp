@@ -216,6 +216,27 @@ TEST(Notify, ALifeIsANumberOrAPlace) {
     }
 }
 
+// A router often is several devices, each with a life of its own; a neighbour may send any number in its name.
+TEST(Notify, EachDeviceOfARouterHasALifeOfItsOwn) {
+    const auto fnMessage = [](const std::string& szDevice, const std::string& szPlace) {
+        return "NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: uuid:" + szDevice +
+               "::upnp:rootdevice\r\nLOCATION: " + szPlace + "\r\n\r\n";
+    };
+    tavo::Lives lives;
+    const std::tuple<const char*, const char*, bool> rgCases[] = {
+        {"igd", "http://192.168.1.1:5000/", true},  {"media", "http://192.168.1.1:8200/", true},
+        {"igd", "http://192.168.1.1:5000/", false}, {"media", "http://192.168.1.1:8200/", false},
+        {"igd", "http://192.168.1.1:5001/", true},  {"igd", "http://192.168.1.1:5001/", false}};
+    for (const auto& [szDevice, szPlace, blNews] : rgCases) {
+        EXPECT_EQ(lives.IsNews(fnMessage(szDevice, szPlace)), blNews) << szDevice << " " << szPlace;
+    }
+    for (int i = 0; i < 10000; ++i) {
+        lives.IsNews(fnMessage(std::to_string(i), "x"));
+        ASSERT_LE(lives.Size(), 64U);
+    }
+    EXPECT_FALSE(lives.IsNews("NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nUSN: new\r\nLOCATION: x\r\n\r\n"));
+}
+
 class MemoryRouter : public tavo::Router {
 public:
     int List(std::vector<RouterMapping>& rgMappings) override {

@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 #include "core/SysLog.h"
 #include "core/TextFile.h"
@@ -20,6 +21,7 @@ constexpr uint16_t kSsdpPort = 1900;
 constexpr char kGroup[] = "239.255.255.250";
 constexpr size_t kMaxMessage = 4096;
 constexpr size_t kMaxLife = 256;
+constexpr size_t kMostDevices = 64;
 constexpr int kMessagesAtOnce = 64;  // of a flood, no more than these are looked at in one go
 
 // The value of a header, whose name ends with the colon; empty where there is none.
@@ -43,8 +45,24 @@ std::optional<std::string> LifeOf(std::string_view szMessage) {
     return PrintableText(szBoot.empty() ? Header(szMessage, "LOCATION:") : szBoot, kMaxLife);
 }
 
+bool Lives::IsNews(std::string_view szMessage) {
+    const auto szLife = LifeOf(szMessage);
+    if (!szLife) {
+        return false;
+    }
+    const std::string szDevice = PrintableText(Header(szMessage, "USN:"), kMaxLife);
+    if (szLife->empty()) {
+        mMapLives.erase(szDevice);
+        return false;
+    }
+    if (mMapLives.size() >= kMostDevices && !mMapLives.contains(szDevice)) {
+        mMapLives.clear();
+    }
+    return std::exchange(mMapLives[szDevice], *szLife) != *szLife;
+}
+
 void Announcements::Listen(const std::string& szLocal) {
-    mSzLife.clear();
+    mLives.Forget();
     mFd.Reset(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     const int nOn = 1;
     const int nOff = 0;
@@ -77,10 +95,8 @@ bool Announcements::TakeNews(const std::string& szGateway) {
         }
         char szSender[INET_ADDRSTRLEN] = {};
         inet_ntop(AF_INET, &sender.sin_addr, szSender, sizeof(szSender));
-        const auto szLife = LifeOf({szMessage, static_cast<size_t>(nRead)});
-        if (szGateway == szSender && szLife) {
-            blNews = blNews || (!szLife->empty() && *szLife != mSzLife);
-            mSzLife = *szLife;
+        if (szGateway == szSender && mLives.IsNews({szMessage, static_cast<size_t>(nRead)})) {
+            blNews = true;
         }
     }
     return blNews;
