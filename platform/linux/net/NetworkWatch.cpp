@@ -14,6 +14,7 @@ namespace tavo {
 namespace {
 
 constexpr int kMessageSize = 16384;
+constexpr int kMessagesAtOnce = 256;  // of a flood, no more than these are taken in in one go
 
 }  // namespace
 
@@ -30,13 +31,14 @@ NetworkWatch::NetworkWatch() : mPSocket(Connect()) {
 bool NetworkWatch::TakeChange() {
     bool blChange = false;
     char szMessage[kMessageSize];
-    for (;;) {
+    for (int i = 0; i < kMessagesAtOnce; ++i) {
         const ssize_t nRead = recv(Fd(), szMessage, sizeof(szMessage), MSG_DONTWAIT);
         if (nRead < 0 && errno != ENOBUFS && errno != EINTR) {
             return blChange;
         }
         blChange = true;
     }
+    return blChange;
 }
 
 }  // namespace tavo
