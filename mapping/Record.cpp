@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <iterator>
 
 #include "core/TextFile.h"
 
@@ -11,9 +12,8 @@ namespace tavo {
 namespace {
 
 constexpr char kBootSection[] = "boot";
-constexpr int64_t kSurely = 60;             // seconds after its end until a lease is believed to have ended
-constexpr int64_t kUnshown = 24 * 60 * 60;  // a router that has shown nothing may have made it without a lease
-constexpr size_t kMostElsewhere = 4096;     // rows of routers that may never come back
+constexpr int64_t kMostSeconds = int64_t{1} << 40U;  // no box has run for so long
+constexpr size_t kMostElsewhere = 4096;              // rows of routers that may never come back
 
 template <typename Number>
 Number NumberIn(const std::string& szText) {
@@ -22,11 +22,24 @@ Number NumberIn(const std::string& szText) {
     return nValue;
 }
 
+// The sections of a text whose parts are parted by blank lines. A part that cannot be read is left out.
+std::vector<Section> ReadableSections(std::string_view szText) {
+    std::vector<Section> rgAll;
+    while (!szText.empty()) {
+        const size_t nEnd = szText.find("\n\n");
+        for (Section& section : ParseSections(szText.substr(0, nEnd)).value_or(std::vector<Section>())) {
+            rgAll.push_back(std::move(section));
+        }
+        szText.remove_prefix(nEnd == std::string_view::npos ? szText.size() : nEnd + 2);
+    }
+    return rgAll;
+}
+
 }  // namespace
 
 Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(szBoot)) {
     bool blThisBoot = false;
-    for (const Section& section : ParseSections(szText).value_or(std::vector<Section>())) {
+    for (const Section& section : ReadableSections(szText)) {
         std::map<std::string, std::string> mapValues;
         for (const Pair& pair : section.rgPairs) {
             mapValues[pair.szKey] = pair.szValue;
@@ -39,8 +52,10 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
                       {mapValues["protocol"], NumberIn<uint16_t>(mapValues["router_port"])},
                       {mapValues["client"], NumberIn<uint16_t>(mapValues["box_port"]), mapValues["text"],
                        mapValues["shown"] == "yes", NumberIn<uint32_t>(mapValues["lease"])}};
-        row.made.blBefore = !blThisBoot || mapValues["before"] == "yes";
-        row.made.nAsked = row.made.blBefore ? 0 : NumberIn<int64_t>(mapValues["asked"]);
+        const auto nAsked = NumberIn<int64_t>(mapValues["asked"]);
+        row.made.blBefore = !blThisBoot || mapValues["before"] == "yes" || nAsked < 0 || nAsked > kMostSeconds;
+        row.made.nAsked = row.made.blBefore ? 0 : nAsked;
+        row.made.nOtherPort = NumberIn<uint16_t>(mapValues["other_port"]);
         const bool blProtocol = row.key.first == "TCP" || row.key.first == "UDP";
         if (blProtocol && row.key.second != 0 && row.made.nBoxPort != 0) {
             mRgElsewhere.push_back(std::move(row));
@@ -48,21 +63,28 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
     }
 }
 
+// Where two rows have one place, the one that was in use goes on.
 void Record::TurnTo(const RouterName& router) {
+    std::vector<Elsewhere> rgAll;
     for (auto& [key, made] : mHere) {
-        mRgElsewhere.push_back({mRouter, key, std::move(made)});
+        RouterName name = NameOf(made);
+        rgAll.push_back({std::move(name), key, std::move(made)});
     }
+    std::move(mRgElsewhere.begin(), mRgElsewhere.end(), std::back_inserter(rgAll));
     mHere.clear();
     mRouter = router;
-    std::erase_if(mRgElsewhere, [&](Elsewhere& row) {
-        return row.router.IsSame(router) && mHere.emplace(row.key, std::move(row.made)).second;
+    std::erase_if(rgAll, [&](Elsewhere& row) {
+        if (!row.router.IsSame(router) || mHere.contains(row.key)) {
+            return false;
+        }
+        row.made.szHardware = router.szHardware.empty() ? row.router.szHardware : "";
+        return mHere.emplace(row.key, std::move(row.made)).second;
     });
+    mRgElsewhere = std::move(rgAll);
 }
 
 void Record::Prune(int64_t nNow) {
-    std::erase_if(mRgElsewhere, [nNow](const Elsewhere& row) {
-        return row.made.End() >= 0 && nNow > row.made.End() + (row.made.blShown ? kSurely : kUnshown);
-    });
+    std::erase_if(mRgElsewhere, [nNow](const Elsewhere& row) { return row.made.IsSurelyOver(nNow); });
     if (mRgElsewhere.size() > kMostElsewhere) {
         mRgElsewhere.erase(mRgElsewhere.begin(), mRgElsewhere.end() - kMostElsewhere);
     }
@@ -80,6 +102,7 @@ std::string Record::Text() const {
                                {"protocol", key.first},
                                {"router_port", std::to_string(key.second)},
                                {"box_port", std::to_string(made.nBoxPort)},
+                               {"other_port", std::to_string(made.nOtherPort)},
                                {"client", made.szClient},
                                {"text", made.szText},
                                {"shown", made.blShown ? "yes" : "no"},
@@ -91,7 +114,7 @@ std::string Record::Text() const {
         fnAdd(row.router, row.key, row.made);
     }
     for (const auto& [key, made] : mHere) {
-        fnAdd(mRouter, key, made);
+        fnAdd(NameOf(made), key, made);
     }
     return FormatSections(rgSections);
 }

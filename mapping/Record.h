@@ -43,16 +43,27 @@ struct Made {
     uint32_t nLease = 0;    // seconds from nAsked; 0: until the router restarts
     int64_t nAsked = 0;     // seconds of boot time; of an earlier boot: 0
     bool blBefore = false;  // asked for before this boot, so that nobody knows how long ago
+    // The other port that it may lead to: a change was asked for, and what came of it was not shown. 0: none.
+    uint16_t nOtherPort = 0;
+    std::string szHardware = {};  // of the router that it was made at, where the one in front does not show its own
 
-    // Whether an entry at its place is this one. Routers rewrite texts: until it is shown, what it leads to will do.
+    // Whether an entry at its place is this one. Routers rewrite texts: until it is shown, what it leads to will do, or
+    // our mark. A text that the router gives to everybody's says nothing.
     bool IsEntry(const RouterMapping& entry) const {
         const bool blPort = entry.nBoxPort == nBoxPort;
         const bool blText = entry.szDescription == szText;
-        return entry.szClient == szClient && (blShown ? blPort && blText : blPort || blText);
+        const bool blOther = nOtherPort != 0 && entry.nBoxPort == nOtherPort;
+        const bool blMark = blText && szText.starts_with(kOwnPrefix);
+        return entry.szClient == szClient && (blShown ? blPort && blText : blPort || blOther || blMark);
     }
     bool IsDue(int64_t nNow) const { return blBefore || (nLease != 0 && nNow - nAsked >= nLease / 2); }
     // Boot time at which the router has ended it by itself; -1: never, or nobody knows.
     int64_t End() const { return nLease == 0 ? -1 : nAsked + nLease; }
+    // Whether its lease has surely ended. What a router has not shown may have been made without one: some refuse
+    // leases, and the answer may be lost.
+    bool IsSurelyOver(int64_t nNow) const { return blShown && End() >= 0 && nNow > End() + kSurely; }
+
+    static constexpr int64_t kSurely = 60;  // seconds after its end until a lease is believed to have ended
 };
 
 class Record {
@@ -76,6 +87,10 @@ private:
         MappingKey key;
         Made made;
     };
+
+    RouterName NameOf(const Made& made) const {
+        return {mRouter.szGateway, made.szHardware.empty() ? mRouter.szHardware : made.szHardware};
+    }
 
     std::string mSzBoot;
     RouterName mRouter;

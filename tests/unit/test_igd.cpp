@@ -479,14 +479,16 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     ASSERT_EQ(same.Here().size(), 1U);
     tavo::Made& made = same.Here()[{"TCP", 1}];
     EXPECT_EQ(made.szText, "\"odd\n]text");
-    for (const bool blShown : {true, false}) {  // until it is shown, what it leads to will do, or its text
+    for (const bool blShown : {true, false}) {  // until it is shown, what it leads to will do, or our mark
         made.blShown = blShown;
         EXPECT_TRUE(made.IsEntry(Entry(1, 11, kBox, "\"odd\n]text")));
         EXPECT_EQ(made.IsEntry(Entry(1, 11, kBox, "any")), !blShown);
-        EXPECT_EQ(made.IsEntry(Entry(1, 12, kBox, "\"odd\n]text")), !blShown);
+        EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "\"odd\n]text"))) << "the router may give it to everybody's";
         EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "any")));
         EXPECT_FALSE(made.IsEntry(Entry(1, 11, "192.168.1.9", "\"odd\n]text")));
     }
+    made.szText = "tavo:a";
+    EXPECT_TRUE(made.IsEntry(Entry(1, 12, kBox, "tavo:a")));
     EXPECT_EQ(std::make_tuple(made.IsDue(5049), made.IsDue(5050), made.End()), std::make_tuple(false, true, 5100));
 
     tavo::Record later(szText, "two");
@@ -501,6 +503,63 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     later.TurnTo({"192.168.1.1", "cc:dd"});
     EXPECT_EQ(later.Here().size(), 1U) << "this one never ends";
     EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
+}
+
+TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    for (const uint16_t nPort : {uint16_t{1}, uint16_t{2}, uint16_t{3}}) {
+        record.Here()[{"TCP", nPort}] = {kBox, nPort, "tavo:a", true, 100, 5000};
+    }
+    const std::string szText = record.Text();
+    // What of the second row is written over.
+    for (const char* szDamaged : {"[192.168.1.1 TCP 2]", "router_port=\"2\"", "protocol=\"TCP\"\nrouter_port=\"2\""}) {
+        std::string szBad = szText;
+        szBad.replace(szText.find(szDamaged), 8, std::string("\0\xff\x1b\"=[\\q", 8));
+        tavo::Record damaged(szBad, "one");
+        damaged.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_EQ(damaged.Here().size(), 2U) << szDamaged;
+        EXPECT_TRUE((damaged.Here().contains({"TCP", 1}) && damaged.Here().contains({"TCP", 3}))) << szDamaged;
+    }
+    for (const char* szAsked : {"-9223372036854775808", "9223372036854775807", "99999999999999999999"}) {
+        std::string szBad = szText;
+        szBad.replace(szText.find("5000"), 4, szAsked);
+        tavo::Record odd(szBad, "one");
+        odd.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_TRUE((odd.Here()[{"TCP", 1}].IsDue(6000))) << szAsked;
+    }
+}
+
+TEST(Record, KeepsWhatMayHaveNoLease) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", false, 100, 5000};
+    record.TurnTo({"192.168.1.1", "cc:dd"});
+    record.Prune(5000 + 100 + 30 * 24 * 60 * 60);
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_EQ(record.Here().size(), 1U);
+}
+
+// The neighbour's hardware is not always known. A pass without it must not make one router's rows another one's.
+TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
+    tavo::Record record("", "one");
+    for (const char* szHardware : {"aa:bb", "cc:dd"}) {
+        record.TurnTo({"192.168.1.1", szHardware});
+        record.Here()[{"TCP", 1}] = {kBox, 1, szHardware, true, 0, 5000};
+    }
+    record.TurnTo({"192.168.1.1", ""});
+    const std::string szFirst = record.Here()[{"TCP", 1}].szText;
+    for (int i = 0; i < 3; ++i) {
+        const std::string szText = record.Text();
+        record.TurnTo({"192.168.1.1", ""});
+        EXPECT_EQ((record.Here()[{"TCP", 1}].szText), szFirst) << "the same at each pass";
+        EXPECT_EQ(record.Text(), szText);
+    }
+    for (const char* szHardware : {"aa:bb", "cc:dd", "aa:bb"}) {
+        record.TurnTo({"192.168.1.1", szHardware});
+        ASSERT_EQ(record.Here().size(), 1U);
+        EXPECT_EQ((record.Here()[{"TCP", 1}].szText), szHardware);
+    }
 }
 
 // A router under test: some ports conflict, and some answers are lost after the work was done.
