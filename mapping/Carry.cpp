@@ -19,10 +19,13 @@ constexpr int64_t kReadBackAfter = 20;  // seconds; a slow router's yes is not l
 constexpr int kRangeFrom = 4;           // fewer are asked for one by one
 constexpr int kRangePorts = 64;         // of one request
 constexpr int kMostSteps = 4;           // about one place in one pass: look, take away, add, and one surprise
+constexpr size_t kTogether = 512;       // wanted places that are looked at before the first of them is written
+constexpr size_t kMostSaves = 8;        // of the record in one pass, however many they are
 constexpr char kWritten[] = "written";  // the router said yes, and has not shown it yet
 constexpr char kLost[] = "lost";        // the router said yes, and does not show it
 constexpr size_t kMaxDescription = 64;  // of somebody else's entry
 constexpr int64_t kRenewAgain = 60;     // seconds after a renewal that was refused
+constexpr int64_t kAskAgain = 10;       // seconds after an answer that did not come
 constexpr int64_t kLeastPause = 5;      // seconds between passes, whatever leases a router gives
 constexpr int64_t kNever = std::numeric_limits<int64_t>::max();
 
@@ -31,8 +34,9 @@ struct Place {
     const RouterMapping* pWanted = nullptr;
     Seen enSeen = Seen::kUnknown;
     RouterMapping entry = {};
-    bool blWritten = false;  // asked for in this pass, and not read back yet
-    int nKept = kRouterOk;   // the router's code for what it did not take away
+    bool blWritten = false;   // asked for in this pass, and not read back yet
+    bool blReplaced = false;  // taken away, because the router said yes to a change and did not make it
+    int nKept = kRouterOk;    // the router's code for what it did not take away
     Verdict verdict = {};
 };
 
@@ -54,12 +58,13 @@ private:
     Step StepFor(const MappingKey& key, const Place& place);
     void Show(const RouterMapping& entry);
     void LookAtTable();
-    void LookAtPlaces();
     int Look(const MappingKey& key, Place& place);
-    void TakeAway();
+    void LookAt(const std::vector<MappingKey>& rgKeys);
+    void TakeAway(const std::vector<MappingKey>& rgKeys);
     bool Remove(const MappingKey& key, Place& place);
     bool Intend(const MappingKey& key, const Place& place);
-    void NoteIntents();
+    void NoteIntents(const std::vector<MappingKey>& rgKeys);
+    void Bring(const std::vector<MappingKey>& rgKeys);
     void Settle(const MappingKey& key, Place& place);
     bool Do(const MappingKey& key, Place& place, const Step& step);
     bool Add(const MappingKey& key, Place& place, bool blAnew);
@@ -113,6 +118,7 @@ void Pass::Show(const RouterMapping& entry) {
     }
     pMade->szText = entry.szDescription;
     pMade->nBoxPort = entry.nBoxPort;
+    pMade->nOtherPort = 0;
     // How long a lease is shows right after it was granted; later listings show what is left of it, or nothing new.
     if (place.blWritten || !pMade->blShown) {
         pMade->nLease = pMade->nLease == 0 ? entry.nLease : std::min(pMade->nLease, entry.nLease);
@@ -120,14 +126,13 @@ void Pass::Show(const RouterMapping& entry) {
     pMade->blShown = true;
 }
 
+// What a table does not show may be there: it is read entry by entry, and whatever others take away or make meanwhile
+// moves those that follow.
 void Pass::LookAtTable() {
     std::vector<RouterMapping> rgTable;
-    const int nCode = Note(mRouter.List(rgTable));
+    Note(mRouter.List(rgTable));
     for (const RouterMapping& entry : rgTable) {
         Show(entry);
-    }
-    for (auto& [key, place] : mMapPlaces) {
-        place.enSeen = nCode == kRouterOk && place.enSeen == Seen::kUnknown ? Seen::kAbsent : place.enSeen;
     }
 }
 
@@ -142,9 +147,9 @@ int Pass::Look(const MappingKey& key, Place& place) {
     return nCode;
 }
 
-// Those of ours that the table did not show, because there was no whole table.
-void Pass::LookAtPlaces() {
-    for (auto& [key, place] : mMapPlaces) {
+void Pass::LookAt(const std::vector<MappingKey>& rgKeys) {
+    for (const MappingKey& key : rgKeys) {
+        Place& place = mMapPlaces[key];
         if (!IsOver() && StepFor(key, place).enAction == Action::kLook) {
             Look(key, place);
         }
@@ -165,8 +170,9 @@ bool Pass::Remove(const MappingKey& key, Place& place) {
 }
 
 // What the rules no longer ask for, and what has to go before something else can be made in its place.
-void Pass::TakeAway() {
-    for (auto& [key, place] : mMapPlaces) {
+void Pass::TakeAway(const std::vector<MappingKey>& rgKeys) {
+    for (const MappingKey& key : rgKeys) {
+        Place& place = mMapPlaces[key];
         if (IsOver()) {
             return;
         }
@@ -182,25 +188,47 @@ void Pass::TakeAway() {
 // Puts on record what the router is about to be asked for at a place. True when that is news.
 bool Pass::Intend(const MappingKey& key, const Place& place) {
     Made* pMade = MadeAt(key);
-    if (pMade != nullptr && place.enSeen == Seen::kPresent) {
-        return std::exchange(pMade->blShown, false);  // a change: it may lead to the one port or to the other
+    const uint16_t nPort = place.pWanted->nBoxPort;
+    if (pMade != nullptr && place.enSeen == Seen::kPresent) {  // a change: it may lead to the one port or to the other
+        const bool blNews = pMade->blShown || pMade->nOtherPort != nPort;
+        pMade->blShown = false;
+        pMade->nOtherPort = nPort;
+        return blNews;
     }
-    const bool blNews = pMade == nullptr;
+    const bool blNews = pMade == nullptr || pMade->szClient != mAround.szBox || pMade->nBoxPort != nPort;
     const uint32_t nLease = mHabit.blPermanentOnly ? 0 : mHabit.nLease;
-    mRecord.Here()[key] = {mAround.szBox, place.pWanted->nBoxPort, place.pWanted->szDescription, false,
-                           nLease,        mAround.fnNow()};
+    mRecord.Here()[key] = {mAround.szBox, nPort, place.pWanted->szDescription, false, nLease, mAround.fnNow()};
     return blNews;
 }
 
 // A crash between this and the answers leaves nothing that nobody knows of.
-void Pass::NoteIntents() {
-    for (const auto& [key, place] : mMapPlaces) {
+void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
+    bool blNews = false;
+    for (const MappingKey& key : rgKeys) {
+        const Place& place = mMapPlaces[key];
         const Action enAction = StepFor(key, place).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
-            Intend(key, place);
+            blNews = Intend(key, place) || blNews;
         }
     }
-    mAround.fnSave();
+    if (blNews) {
+        mAround.fnSave();
+    }
+}
+
+// Some of the wanted places, together: looking, saving and writing in turns would be slow.
+void Pass::Bring(const std::vector<MappingKey>& rgKeys) {
+    LookAt(rgKeys);
+    TakeAway(rgKeys);
+    if (!IsOver()) {
+        NoteIntents(rgKeys);
+    }
+    for (const MappingKey& key : rgKeys) {
+        Settle(key, mMapPlaces[key]);
+        if (mAround.fnNow() - mNReadBack > kReadBackAfter) {
+            ReadBack();
+        }
+    }
 }
 
 void Pass::Settle(const MappingKey& key, Place& place) {
@@ -265,8 +293,14 @@ bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
     }
     const int64_t nAsked = mAround.fnNow();
     const int nCode = Note(AddWithLease(mRouter, mapping, mHabit));
+    if (Made* pMade = MadeAt(key); nCode < kRouterOk && mapping.nLease == 0 && pMade != nullptr) {
+        pMade->nLease = 0;  // it may be there by now, without the lease that was asked for at first
+    }
     if (nCode == kRouterOk) {
-        mRecord.Here()[key] = {mAround.szBox, mapping.nBoxPort, mapping.szDescription, false, mapping.nLease, nAsked};
+        // Some say yes to a change, and leave the entry as it was.
+        const uint16_t nBefore = place.enSeen == Seen::kPresent && blAnew ? place.entry.nBoxPort : uint16_t{0};
+        mRecord.Here()[key] = {mAround.szBox, mapping.nBoxPort, mapping.szDescription, false, mapping.nLease, nAsked,
+                               false,         nBefore};
         place.enSeen = Seen::kUnknown;
         place.blWritten = true;
         place.verdict = {PortState::kOpen, kWritten};
@@ -317,11 +351,12 @@ void Pass::ShowRanges() {
 
 // A router's yes is not enough: the mapping must be in its table, and be ours.
 void Pass::ReadBack() {
-    ShowRanges();
-    for (const MappingKey& key : mRgWritten) {
-        Confirm(key, mMapPlaces[key]);
+    while (!mRgWritten.empty()) {  // once more for those that had to be replaced
+        ShowRanges();
+        for (const MappingKey& key : std::exchange(mRgWritten, {})) {
+            Confirm(key, mMapPlaces[key]);
+        }
     }
-    mRgWritten.clear();
     mNReadBack = mAround.fnNow();
 }
 
@@ -338,8 +373,12 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
     if (fnServes()) {
         place.verdict = Open(key, place);
         place.verdict.blAnew = blAnew;
-    } else if (nCode != kRouterOk && nCode != kRouterNoSuchEntry) {
+    } else if (IsOver() || (nCode != kRouterOk && nCode != kRouterNoSuchEntry)) {
         place.verdict = Refusal(nCode);
+    } else if (place.enSeen == Seen::kPresent && IsOurs(place.entry, MadeAt(key), mAround.szBox) &&
+               !std::exchange(place.blReplaced, true) && Remove(key, place)) {
+        place.verdict = {PortState::kRefused, kLost};
+        Settle(key, place);
     } else if (place.enSeen == Seen::kPresent && place.entry.szClient != mAround.szBox) {
         place.verdict = InTheWay(place.entry);
         mRecord.Here().erase(key);
@@ -378,8 +417,8 @@ Verdict Pass::StillHeld(const MappingKey& key, int nCode) {
         verdict.enState = PortState::kWaiting;
         verdict.szWhy = "the router keeps it for this box's former address " + pMade->szClient;
     }
-    if (pMade->End() >= 0) {
-        const int64_t nNow = mAround.fnNow();
+    const int64_t nNow = mAround.fnNow();
+    if (pMade->End() >= nNow) {  // else the router does not keep to it, and nobody knows for how long
         verdict.nLease = static_cast<uint32_t>(std::max<int64_t>(pMade->End() - nNow, 1));
         Wake(pMade->End() + 1);
     }
@@ -393,8 +432,14 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     }
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = mMapPlaces[KeyOf(wanted)];
-        const bool blTold = !place.verdict.szWord.empty();
-        mResult.rgOutcomes.push_back(OutcomeOf(wanted, blTold ? place.verdict : Refusal(mResult.nTransport)));
+        if (place.verdict.szWord.empty()) {
+            const bool blLost = mResult.nTransport == kRouterOk && !mResult.blStopped;
+            place.verdict = Refusal(blLost ? int{kRouterTimeout} : mResult.nTransport);
+        }
+        if (place.verdict.enState == PortState::kUnknown) {
+            Wake(mAround.fnNow() + kAskAgain);
+        }
+        mResult.rgOutcomes.push_back(OutcomeOf(wanted, place.verdict));
     }
     for (const auto& [key, place] : mMapPlaces) {
         const Made* pMade = MadeAt(key);
@@ -426,17 +471,23 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
         mMapPlaces[key];
     }
     mNReadBack = mAround.fnNow();
+    mAround.fnSave();  // what could not be written before
     LookAtTable();
-    LookAtPlaces();
-    TakeAway();
-    if (!IsOver()) {
-        NoteIntents();
-    }
-    for (const RouterMapping& wanted : rgWanted) {
-        Settle(KeyOf(wanted), mMapPlaces[KeyOf(wanted)]);
-        if (mAround.fnNow() - mNReadBack > kReadBackAfter) {
-            ReadBack();
+    std::vector<MappingKey> rgUnwanted;
+    for (const auto& [key, place] : mMapPlaces) {
+        if (place.pWanted == nullptr) {
+            rgUnwanted.push_back(key);
         }
+    }
+    LookAt(rgUnwanted);
+    TakeAway(rgUnwanted);
+    const size_t nTogether = std::max(kTogether, rgWanted.size() / kMostSaves + 1);
+    for (size_t i = 0; i < rgWanted.size(); i += nTogether) {
+        std::vector<MappingKey> rgKeys;
+        for (size_t j = i; j < std::min(i + nTogether, rgWanted.size()); ++j) {
+            rgKeys.push_back(KeyOf(rgWanted[j]));
+        }
+        Bring(rgKeys);
     }
     ReadBack();
     Conclude(rgWanted);

@@ -5,11 +5,14 @@ namespace tavo {
 
 namespace {
 
-Step Unwanted(const PlaceView& view, const std::string& szBox) {
+Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow) {
     switch (view.enSeen) {
         case Seen::kUnknown:
             return view.pMade == nullptr ? Step{} : Step{Action::kLook, "no rule asks for it, and it may be there"};
         case Seen::kHidden:
+            if (view.pMade != nullptr && view.pMade->IsSurelyOver(nNow)) {
+                return {Action::kForget, "its lease is over, and the place may be somebody else's"};
+            }
             return view.pMade == nullptr ? Step{} : Step{Action::kRemove, "no rule asks for what we made here"};
         case Seen::kAbsent:
             return view.pMade == nullptr ? Step{} : Step{Action::kForget, "the router has it no more"};
@@ -52,11 +55,11 @@ bool Serves(const RouterMapping& entry, const RouterMapping& wanted, const std::
 
 Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow) {
     if (view.pWanted == nullptr) {
-        return Unwanted(view, szBox);
+        return Unwanted(view, szBox, nNow);
     }
     switch (view.enSeen) {
         case Seen::kUnknown:
-            return {Action::kLook, "a rule asks for it"};
+            return {Action::kLook, "a rule asks for it, and nobody has looked"};
         case Seen::kPresent:
             return WantedAndThere(view, szBox, nNow);
         default:

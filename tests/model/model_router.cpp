@@ -55,7 +55,7 @@ int Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
             if (habits.nListCode != tavo::kRouterOk && rgMappings.size() >= kFirstEntries) {
                 break;
             }
-            if (habits.nListCode <= tavo::kRouterOk) {
+            if (habits.nListCode <= tavo::kRouterOk && !Chance(nSkipPerMille)) {
                 rgMappings.push_back(Shown(entry));
             }
         }
@@ -104,8 +104,11 @@ int Router::DoAdd(const tavo::RouterMapping& mapping) {
         if (pThere->mapping.szClient != mapping.szClient || (!blSame && !habits.blOverwrites)) {
             return tavo::kRouterConflict;
         }
-        if (!pThere->blBox) {
+        if (!pThere->blBox && !pThere->blOrphan) {
             szBroken = "another program's mapping is changed";
+        }
+        if (!blSame && habits.blSaysChanged) {
+            return tavo::kRouterOk;
         }
     } else if (mMapTable.size() >= habits.nCapacity) {
         return habits.blSaysFull ? kFull : static_cast<int>(tavo::kRouterOk);
@@ -115,11 +118,12 @@ int Router::DoAdd(const tavo::RouterMapping& mapping) {
         entry.mapping.nLease = habits.nLongestLease;
     }
     entry.nEnd = entry.mapping.nLease == 0 ? 0 : mNNow + entry.mapping.nLease;
-    entry.mapping.szDescription = habits.nText == 0 ? mapping.szDescription : habits.nText == 1 ? "upnp mapping" : "";
+    entry.mapping.szDescription = TextOf(mapping.szDescription);
     return tavo::kRouterOk;
 }
 
 int Router::Add(const tavo::RouterMapping& mapping) {
+    fnBeforeAdd(mapping);
     const int nCode = Answer([&] { return DoAdd(mapping); });
     fnTell("add " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " -> " + mapping.szClient + ":" +
            std::to_string(mapping.nBoxPort) + " = " + std::to_string(nCode));
@@ -134,7 +138,7 @@ int Router::DoRemove(const tavo::MappingKey& key) {
     if (habits.blSecure && pEntry->mapping.szClient != szBox) {
         return kNotAuthorized;
     }
-    if (!pEntry->blBox) {
+    if (!pEntry->blBox && !pEntry->blOrphan) {
         szBroken = "somebody else's mapping is taken away";
     }
     mMapTable.erase(key);

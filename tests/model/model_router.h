@@ -22,13 +22,14 @@ struct Habits {
     bool blForgetsLease = false;  // makes it with a lease, and lists none
     bool blListsWhatIsLeft = false;
     uint32_t nLongestLease = 0;  // 0: any
-    int nText = 0;               // 0 kept, 1 rewritten, 2 dropped
+    int nText = 0;               // 0 kept, 1 rewritten, 2 dropped; everybody's
     bool blSecure = false;       // only the client may make, change and delete its entries
     bool blOverwrites = true;    // a client's own entry at its place; else 718 for any change
     size_t nCapacity = 1000;
     bool blSaysFull = true;  // else it says yes and keeps nothing
     int nListCode = 0;       // what a listing answers; below 0 with the first entries
     bool blRanges = false;
+    bool blSaysChanged = false;  // says yes to a change of its own entry, and keeps it as it was
 };
 
 class Router : public tavo::Router {
@@ -37,8 +38,9 @@ public:
 
     struct Entry {
         tavo::RouterMapping mapping;
-        int64_t nEnd = 0;    // 0: never
-        bool blBox = false;  // made by the code under test
+        int64_t nEnd = 0;       // 0: never
+        bool blBox = false;     // made by the code under test
+        bool blOrphan = false;  // was made by it, and nobody can know that any more
     };
 
     int List(std::vector<tavo::RouterMapping>& rgMappings) override;
@@ -47,6 +49,11 @@ public:
     int Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override;
     int Add(const tavo::RouterMapping& mapping) override;
     int Remove(const std::string& szProtocol, uint16_t nRouterPort) override;
+
+    // How the router keeps a description.
+    std::string TextOf(const std::string& szText) const {
+        return habits.nText == 0 ? szText : habits.nText == 1 ? "upnp mapping" : "";
+    }
 
     // ---- the world's side -----------------------------------------------------------------------
 
@@ -61,10 +68,12 @@ public:
     bool blAway = false;    // answers nothing
     int nLosePerMille = 0;  // answers that are lost, after or before the request took effect
     int nKillPerMille = 0;  // requests at which our process dies
+    int nSkipPerMille = 0;  // entries that a listing leaves out, because somebody else changes the table meanwhile
     std::map<tavo::MappingKey, Entry> mMapTable;
     int nRequests = 0;
     std::function<void(std::string)> fnTell;  // each change that is asked for
-    std::string szBroken;                     // a promise that a request of ours has broken
+    std::function<void(const tavo::RouterMapping&)> fnBeforeAdd;
+    std::string szBroken;  // a promise that a request of ours has broken
 
 private:
     bool Chance(int nPerMille) { return static_cast<int>(mRandom() % 1000) < nPerMille; }

@@ -44,9 +44,12 @@ public:
         const int rgListCodes[] = {0, 0, 0, tavo::kRouterTooLong, 401, 501};
         habits.nListCode = rgListCodes[Pick(6)];
         habits.blRanges = OneIn(3);
+        habits.blSaysChanged = OneIn(6);
+        mBlHardware = !OneIn(5);
         mNCheck = OneIn(2) ? 120 : 600;
         mRouter.szBox = "192.168.1.5";
         mRouter.fnTell = [this](std::string szWhat) { Tell("  " + std::move(szWhat)); };
+        mRouter.fnBeforeAdd = [this](const RouterMapping& mapping) { CheckOnRecord(tavo::KeyOf(mapping)); };
         Boot();
     }
 
@@ -79,6 +82,9 @@ private:
 
     // The process begins anew with what is on the disk, perhaps after a boot.
     void Start() {
+        if (std::exchange(mBlStale, false)) {
+            OrphanAll();
+        }
         mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
         mHabit = {};
         mNNext = mNNow;
@@ -90,12 +96,25 @@ private:
         Start();
     }
     void Trouble() { mNPeace = 0; }
+    static void Orphan(std::map<MappingKey, model::Router::Entry>& mapTable) {
+        for (auto& [key, entry] : mapTable) {
+            entry.blOrphan = entry.blOrphan || entry.blBox;
+            entry.blBox = false;
+        }
+    }
+    // Dead with a disk that could not be written: what it says is out of date.
+    void OrphanAll() {
+        Orphan(mRouter.mMapTable);
+        Orphan(mMapOther);
+        mSzDisk.clear();
+    }
+    tavo::RouterName Name() const { return {"192.168.1.1", !mBlHardware ? "" : mBlOther ? "bb" : "aa"}; }
 
     // ---- what happens ------------------------------------------------------------------------------
 
     void Happen() {
         const bool blQuiet = std::exchange(mBlQuiet, false);
-        switch (Pick(13)) {
+        switch (Pick(16)) {
             case 0:
             case 1:
             case 2:
@@ -134,6 +153,19 @@ private:
             case 11:
                 SwapRouters();
                 break;
+            case 12:
+                mBlDiskFull = !mBlDiskFull;
+                Tell(mBlDiskFull ? "disk full" : "disk has room");
+                break;
+            case 13:
+                mRouter.nSkipPerMille = mRouter.nSkipPerMille == 0 ? 200 : 0;
+                Tell("entries left out of listings: " + std::to_string(mRouter.nSkipPerMille));
+                break;
+            case 14:
+                mNStopIn = static_cast<int>(1 + Pick(60));
+                Tell("a stop comes");
+                ChangeRules();
+                break;
             default:
                 Tell("nothing");
                 mBlQuiet = blQuiet;
@@ -163,9 +195,9 @@ private:
         if (pEntry == nullptr) {
             const std::string szClient = OneIn(2) ? kStranger : mRouter.szBox;
             mRouter.mMapTable[key] = {{key.first, key.second, static_cast<uint16_t>(200 + Pick(3)), szClient,
-                                       mRouter.habits.nText == 1 ? "upnp mapping" : "game", 0, true}};
+                                       mRouter.TextOf("game"), 0, true}};
             Tell("stranger " + szClient + " takes " + key.first + std::to_string(key.second));
-        } else if (!pEntry->blBox) {
+        } else if (!pEntry->blBox && !pEntry->blOrphan) {
             mRouter.mMapTable.erase(key);
             Tell("stranger leaves " + key.first + std::to_string(key.second));
         }
@@ -175,6 +207,10 @@ private:
     void SwapRouters() {
         std::swap(mRouter.mMapTable, mMapOther);
         mBlOther = !mBlOther;
+        if (!mBlHardware) {  // nothing tells one from the other
+            Orphan(mRouter.mMapTable);
+            Orphan(mMapOther);
+        }
         Tell(mBlOther ? "other router" : "first router again");
         mNNext = mNNow;
     }
@@ -183,24 +219,30 @@ private:
 
     void RunPass() {
         const auto mapBefore = mRouter.mMapTable;
-        const int64_t nAllowance = mRouter.nLosePerMille + mRouter.nKillPerMille + (mRouter.blAway ? 1 : 0);
-        mPRecord->TurnTo({"192.168.1.1", mBlOther ? "bb" : "aa"});
+        const int nRequestsBefore = mRouter.nRequests;
+        const int64_t nAllowance =
+            mRouter.nLosePerMille + mRouter.nKillPerMille + mRouter.nSkipPerMille + (mRouter.blAway ? 1 : 0) + mNStopIn;
+        mPRecord->TurnTo(Name());
+        mPRecord->Prune(mNNow - mNBootAt);
+        const std::string szRecordBefore = mPRecord->Text();
+        mNAdds = 0;
         mHabit.nLease = 3600;
         tavo::PassResult result;
         try {
-            mPRecord->Prune(mNNow - mNBootAt);
             result = tavo::BringInLine(mRouter, mRgWanted, *mPRecord, mHabit,
-                                       {mRouter.szBox, [this] { return mNNow - mNBootAt; }, [] { return false; },
-                                        [this] { mSzDisk = mPRecord->Text(); }});
+                                       {mRouter.szBox, [this] { return mNNow - mNBootAt; },
+                                        [this] { return mNStopIn > 0 && --mNStopIn == 0; }, [this] { Save(); }});
         } catch (const model::Killed&) {
             mRouter.nKillPerMille = 0;
+            mNStopIn = 0;
             Tell("killed");
             Start();
             CheckStrangers(mapBefore);
             return;
         }
         mRouter.nKillPerMille = 0;
-        const bool blWell = result.nTransport == tavo::kRouterOk;
+        mNStopIn = 0;
+        const bool blWell = result.nTransport == tavo::kRouterOk && !result.blStopped;
         const int nNext = result.nNextSeconds > 0 ? std::min(mNCheck, result.nNextSeconds) : mNCheck;
         mNNext = mNNow + (blWell ? nNext : std::min(mNCheck, kRetrySeconds));
         mNPeace = nAllowance == 0 && blWell ? mNPeace + 1 : 0;
@@ -209,7 +251,41 @@ private:
         if (mNPeace >= kPassesToPeace) {
             CheckPeace(result);
         }
+        if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.nListCode == tavo::kRouterOk) {
+            CheckCost(result, mRouter.nRequests - nRequestsBefore, mPRecord->Text() != szRecordBefore);
+        } else {
+            mBlAllOpen = false;
+        }
         mBlQuiet = mBlQuiet || mNPeace >= kPassesToPeace;
+    }
+
+    void Save() {
+        mBlStale = mBlDiskFull;
+        if (!mBlDiskFull) {
+            mSzDisk = mPRecord->Text();
+        }
+    }
+
+    // Every mapping is on record before the router is asked.
+    void CheckOnRecord(const MappingKey& key) {
+        ++mNAdds;
+        tavo::Record disk(mSzDisk, "");
+        disk.TurnTo(Name());
+        if (!mBlDiskFull && !disk.Here().contains(key)) {
+            Broken("asked for and not on record", key);
+        }
+    }
+
+    // A pass over what is as it is to be costs one listing, and no write.
+    void CheckCost(const tavo::PassResult& result, int nRequests, bool blWritten) {
+        const bool blAllOpen =
+            std::all_of(result.rgOutcomes.begin(), result.rgOutcomes.end(), [](const tavo::Outcome& outcome) {
+                return outcome.verdict.enState == tavo::PortState::kOpen && !outcome.blLeftOver;
+            });
+        if (std::exchange(mBlAllOpen, blAllOpen) && blAllOpen && (nRequests != 1 || blWritten)) {
+            Broken(std::to_string(nRequests) + " requests" + (blWritten ? " and a write" : "") + " about nothing",
+                   {"TCP", 1});
+        }
     }
 
     void Broken(const std::string& szPromise, const MappingKey& key) {
@@ -231,7 +307,7 @@ private:
         }
         for (const auto& [key, before] : mapBefore) {
             const model::Router::Entry* pNow = mRouter.At(key);
-            if (!before.blBox &&
+            if (!before.blBox && !before.blOrphan &&
                 (pNow == nullptr || pNow->blBox || pNow->mapping.nBoxPort != before.mapping.nBoxPort)) {
                 Broken("a stranger's entry changed", key);
             }
@@ -252,10 +328,13 @@ private:
             if (verdict.enState == tavo::PortState::kOpen && !blThere) {
                 Broken("said to be open and is not", key);
             }
+            if (!blTrouble && verdict.szWord == "lost" && blThere) {
+                Broken("said to be lost and is there", key);
+            }
             if (mBlQuiet && !blTrouble && verdict.blAnew && mSetOpen.contains(key) && !mRouter.habits.blForgetsLease) {
                 Broken("made anew where nothing had happened: closed until now", key);
             }
-            if (verdict.enState == tavo::PortState::kOpen) {
+            if (verdict.enState == tavo::PortState::kOpen && pEntry != nullptr && pEntry->blBox) {
                 mSetOpen.insert(key);
             } else {
                 mSetOpen.erase(key);
@@ -303,6 +382,12 @@ private:
     std::map<MappingKey, model::Router::Entry> mMapOther;
     bool mBlOther = false;
     std::vector<RouterMapping> mRgWanted;
+    bool mBlHardware = true;  // the routers can be told apart
+    bool mBlDiskFull = false;
+    bool mBlStale = false;          // the disk has not taken the newest record
+    bool mBlAllOpen = false;        // at the last pass whose cost was looked at
+    int mNStopIn = 0;               // looks at the stop until there is one; 0: there is none
+    int mNAdds = 0;                 // of this pass
     std::set<MappingKey> mSetOpen;  // at the last look
     std::string mSzDisk;
     std::unique_ptr<tavo::Record> mPRecord;

@@ -378,14 +378,14 @@ TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
     for (uint16_t nPort = 1; nPort <= 10; ++nPort) {
         rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
     }
-    // What the range answers, what it hides, what the router swallows: the calls for a listing, ten
+    // What the range answers, what it hides, what the router swallows: the calls for a listing, ten looks, ten
     // mappings and their proof, and the status of the fifth.
     const std::tuple<int, int, int, int, const char*> rgCases[] = {
-        {tavo::kRouterOk, 0, 0, 1 + 10 + 1, "1"},
-        {tavo::kRouterOk, 5, 0, 1 + 10 + 1 + 1, "1"},
-        {tavo::kRouterOk, 0, 5, 1 + 10 + 1 + 1, "lost"},
-        {tavo::kRouterInvalidAction, 0, 5, 1 + 10 + 1 + 10, "lost"},
-        {tavo::kRouterTimeout, 0, 0, 1 + 10 + 1 + 10, "1"}};
+        {tavo::kRouterOk, 0, 0, 1 + 10 + 10 + 1, "1"},
+        {tavo::kRouterOk, 5, 0, 1 + 10 + 10 + 1 + 1, "1"},
+        {tavo::kRouterOk, 0, 5, 1 + 10 + 10 + 1 + 1, "lost"},
+        {tavo::kRouterInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 10, "lost"},
+        {tavo::kRouterTimeout, 0, 0, 1 + 10 + 10 + 1 + 10, "1"}};
     for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] : rgCases) {
         MemoryRouter router;
         router.mNRangeCode = nCode;
@@ -463,6 +463,111 @@ TEST(Mapping, CodesAndNothingButCodesAreNoRouterThatServes) {
     const auto result = core.Run(router, {});
     EXPECT_EQ(result.nTransport, tavo::kRouterGarbage);
     EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 501 left over"});
+}
+
+// Whoever takes an entry away while the table is read moves those that follow: some are not shown.
+TEST(Mapping, WhatAListingLeavesOutMayBeThere) {
+    MemoryRouter router;
+    Core core;
+    router.mSzRewritten = "upnp";
+    core.Run(router, {Entry(1, 1, "", "tavo:a")});
+    router.mMapTable[{"TCP", 2}] = Entry(2, 9, kBox, "upnp");  // another program's
+    router.mBlListNothing = true;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})),
+              std::vector<std::string>{"2/tcp 718 192.168.1.5 upnp others"});
+    EXPECT_FALSE(router.mMapTable.contains({"TCP", 1})) << "known, and taken away";
+    EXPECT_EQ((router.mMapTable[{"TCP", 2}].nBoxPort), 9);
+}
+
+TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
+    class Stubborn : public MemoryRouter {
+    public:
+        int Add(const RouterMapping& mapping) override {
+            const auto it = mMapTable.find({mapping.szProtocol, mapping.nRouterPort});
+            return it != mMapTable.end() ? int{tavo::kRouterOk} : MemoryRouter::Add(mapping);
+        }
+    };
+    for (const char* szText : {"", "upnp"}) {
+        Stubborn router;
+        Core core;
+        router.mSzRewritten = szText;
+        core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 2, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
+        EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 2);
+        core.Run(router, {});
+        EXPECT_TRUE(router.mMapTable.empty());
+    }
+}
+
+// The change was asked for, the process died, the router restarted, and another program has the place.
+TEST(Mapping, ATextThatTheRouterGivesToEverybodysProvesNothing) {
+    MemoryRouter router;
+    Core core;
+    router.mSzRewritten = "upnp";
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {kBox, 1, "upnp", false, 3600, core.nNow};
+    router.mMapTable[{"TCP", 1}] = Entry(1, 9, kBox, "upnp");
+    EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+    EXPECT_EQ(router.mMapTable.size(), 1U);
+}
+
+TEST(Mapping, AStopInTheMiddleLosesNothing) {
+    MemoryRouter router;
+    tavo::Record record("", "boot");
+    tavo::LeaseHabit habit;
+    record.TurnTo({"192.168.1.1", ""});
+    const auto result =
+        tavo::BringInLine(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
+                          {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] {}});
+    EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
+    EXPECT_TRUE(record.Here().contains({"TCP", 1}));
+}
+
+// A port whose answer was lost does not wait for the next check, which may be an hour away.
+TEST(Mapping, AnAnswerThatIsLostIsAskedForAgainSoon) {
+    class Lossy : public MemoryRouter {
+    public:
+        int Add(const RouterMapping& mapping) override {
+            MemoryRouter::Add(mapping);
+            return tavo::kRouterTimeout;
+        }
+    };
+    Lossy router;
+    const auto result = Core().Run(router, {Entry(1, 1, "", "tavo:a")});
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp timeout"});
+    EXPECT_EQ(std::make_pair(result.nTransport, result.nNextSeconds), std::make_pair(int{tavo::kRouterOk}, 10));
+}
+
+// One that keeps a mapping beyond its lease is not asked about it every few seconds for ever.
+TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
+    MemoryRouter router;
+    Core core;
+    core.nNow = 10000;
+    router.Add(Entry(1, 1, "192.168.1.4", "upnp"));
+    router.mNRemoveCode = 606;
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - 7200};
+    const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 606"});
+    EXPECT_EQ(std::make_pair(result.nNextSeconds, result.rgOutcomes[0].verdict.nLease), std::make_pair(0, 0U));
+}
+
+// Where nothing can be seen, what is taken away blindly is only what must still be ours.
+TEST(Mapping, ABlindRemovalEndsWithTheLease) {
+    for (const int nAge : {3600, 3661}) {
+        MemoryRouter router;
+        Core core;
+        router.mBlListNothing = true;
+        router.mNListCode = 401;
+        router.mNGetCode = 401;
+        router.mMapTable[{"TCP", 1}] = Entry(1, 1, "192.168.1.9", "theirs");
+        core.nNow = 10000;
+        core.record.TurnTo({"192.168.1.1", ""});
+        core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow - nAge};
+        core.Run(router, {});
+        EXPECT_EQ(router.mMapTable.size(), nAge == 3600 ? 0U : 1U);
+        EXPECT_TRUE(core.record.Here().empty());
+    }
 }
 
 TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
