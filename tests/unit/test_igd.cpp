@@ -2,10 +2,12 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <map>
 #include <set>
 #include <tuple>
 
+#include "daemons/common/MadeFile.h"
 #include "daemons/common/TestMappings.h"
 #include "mapping/Carry.h"
 #include "upnp/Igd.h"
@@ -643,6 +645,26 @@ TEST(Record, KeepsWhatMayHaveNoLease) {
     record.Prune(5000 + 100 + 30 * 24 * 60 * 60);
     record.TurnTo({"192.168.1.1", "aa:bb"});
     EXPECT_EQ(record.Here().size(), 1U);
+}
+
+// Every port of both protocols, with texts as long as a router may show them.
+TEST(Record, OfEveryPortIsReadBack) {
+    constexpr char kFile[] = "/var/lib/tavo/every_port.conf";
+    {
+        tavo::MadeFile file(kFile);
+        file.Get().TurnTo({"192.168.100.100", "aa:bb:cc:dd:ee:ff"});
+        for (int i = 1; i <= 65535; ++i) {
+            for (const char* szProtocol : {"TCP", "UDP"}) {
+                const auto nPort = static_cast<uint16_t>(i);
+                file.Get().Here()[{szProtocol, nPort}] = {kBox, nPort, std::string(256, 'x'), true, 3600, 5000};
+            }
+        }
+        file.Save();
+    }
+    tavo::MadeFile again(kFile);
+    again.Get().TurnTo({"192.168.100.100", "aa:bb:cc:dd:ee:ff"});
+    EXPECT_EQ(again.Get().Here().size(), 2U * 65535U);
+    std::remove(kFile);
 }
 
 // The neighbour's hardware is not always known. A pass without it must not make one router's rows another one's.

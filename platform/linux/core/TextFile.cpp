@@ -22,7 +22,6 @@ namespace tavo {
 namespace {
 
 constexpr char kFile[] = "platform/linux/core/TextFile.cpp";
-constexpr size_t kMaxFile = TLIBC_MAX_FILE;
 constexpr char kHexDigits[] = "0123456789abcdef";
 
 bool Fail(int nErr, int nLine) {
@@ -271,7 +270,7 @@ std::string DirectoryOf(const std::string& szPath) {
     return nSlash == std::string::npos ? "." : szPath.substr(0, nSlash + 1);
 }
 
-std::optional<std::string> ReadFile(const std::string& szPath) {
+std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost) {
     const Descriptor fd(open(szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
     struct stat status = {};
     if (fd.Get() < 0) {
@@ -289,7 +288,7 @@ std::optional<std::string> ReadFile(const std::string& szPath) {
         if (nRead < 0 && errno == EINTR) {
             continue;
         }
-        if (nRead < 0 || szText.size() + static_cast<size_t>(nRead) > kMaxFile) {
+        if (nRead < 0 || szText.size() + static_cast<size_t>(nRead) > nMost) {
             Fail(TLIBC_ERR_READ, __LINE__);
             return std::nullopt;
         }
@@ -301,8 +300,8 @@ std::optional<std::string> ReadFile(const std::string& szPath) {
 }
 
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode,
-                     const std::function<bool(int fd)>& fnWhole) {
-    if (szText.size() > kMaxFile) {
+                     const std::function<bool(int fd)>& fnWhole, size_t nMost) {
+    if (szText.size() > nMost) {
         return Fail(TLIBC_ERR_WRITE, __LINE__);
     }
     const std::string szTarget = Resolve(szPath);

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "core/Export.h"
+#include "tavo/core.h"
 
 namespace tavo {
 
@@ -32,15 +33,15 @@ struct Section {
 std::string DirectoryOf(const std::string& szPath);
 
 // The whole file. Nothing, with the last error set, when it is missing (TLIBC_ERR_NOT_FOUND), unreadable,
-// no regular file or larger than 16 MiB.
-TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath);
+// no regular file or larger than nMost bytes.
+TAVO_PLATFORM_API std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost = TLIBC_MAX_FILE);
 
 // Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
 // (nNewMode for a new file), renamed over it. A link is followed. fnWhole is shown the new file while the old one
-// stands, and may refuse it. False with the last error set, also for a text that ReadFile would refuse.
+// stands, and may refuse it. False with the last error set, also for a text of more than nMost bytes.
 TAVO_PLATFORM_API bool WriteFileAtomic(const std::string& szPath, std::string_view szText,
                                        mode_t nNewMode = kPrivateMode,
-                                       const std::function<bool(int fd)>& fnWhole = nullptr);
+                                       const std::function<bool(int fd)>& fnWhole = nullptr, size_t nMost = TLIBC_MAX_FILE);
 
 // All sections in file order; two of one name stay two. Nothing when any line is neither section, pair,
 // comment nor blank; pnBadLine, where given, is its number.

@@ -16,7 +16,7 @@ constexpr char kStateDir[] = "/var/lib/tavo";
 }  // namespace
 
 MadeFile::MadeFile(const char* szPath)
-    : mSzPath(szPath), mSzWritten(ReadFile(szPath).value_or("")), mRecord(mSzWritten, BootId()) {}
+    : mSzPath(szPath), mSzWritten(ReadFile(szPath, kMostRecordText).value_or("")), mRecord(mSzWritten, BootId()) {}
 
 void MadeFile::Save() {
     std::string szText = mRecord.Text();
@@ -24,7 +24,7 @@ void MadeFile::Save() {
         return;
     }
     mkdir(kStateDir, 0755);
-    if (!WriteFileAtomic(mSzPath, szText)) {
+    if (!WriteFileAtomic(mSzPath, szText, kPrivateMode, nullptr, kMostRecordText)) {
         SysLog(LOG_ERR, "cannot write %s: mappings may outlive a crash", mSzPath);
         return;
     }

@@ -10,6 +10,7 @@
 #include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "daemons/common/BootClock.h"
+#include "daemons/common/MadeFile.h"
 #include "mapping/Pass.h"
 
 namespace tavo {
@@ -32,7 +33,7 @@ long Number(const std::string& szText) {
 }  // namespace
 
 void HeldMappings::Load() {
-    mSzWritten = ReadFile(kStateFile).value_or("");
+    mSzWritten = ReadFile(kStateFile, kMostRecordText).value_or("");
     bool blThisBoot = false;
     for (const Section& section : ParseSections(mSzWritten).value_or(std::vector<Section>())) {
         std::map<std::string, std::string> mapValues;
@@ -78,7 +79,7 @@ void HeldMappings::Save() {
         return;
     }
     mkdir(kStateDir, 0755);
-    if (!WriteFileAtomic(kStateFile, szText)) {
+    if (!WriteFileAtomic(kStateFile, szText, kPrivateMode, nullptr, kMostRecordText)) {
         SysLog(LOG_ERR, "cannot write %s: mappings may outlive a crash until they run out", kStateFile);
         return;
     }
