@@ -1,5 +1,6 @@
 """The world moves while rules are in force: the box's address, and routers that forget, rewrite, or are slow to tell."""
 import json
+import os
 import signal
 import time
 import unittest
@@ -98,6 +99,19 @@ class World(unittest.TestCase):
                 sh(up)
             wait_for(lambda: json.loads(LAB.read(PUBLISHED))["router"] == "ok", 20, "and back")
         self.assertTrue(LAB.reaches("tcp", 5001))
+
+    def test_a_router_stays_itself_when_its_hardware_is_forgotten(self):
+        """As after a cable that was out. What was made at another device of its address is not looked for here."""
+        made = "/var/lib/tavo/upnp_made.conf"
+        os.makedirs(os.path.dirname(made), exist_ok=True)
+        LAB.write(made, f'[elsewhere]\ngateway="{GATEWAY}"\nhardware="02:00:00:00:00:99"\nprotocol="TCP"\n'
+                        f'router_port="5009"\nbox_port="5009"\nclient="{BOX}"\ntext="x"\nshown="yes"\nlease="0"\n')
+        LAB.start_router()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        for _ in range(4):
+            self.assertIn('router_port="5009"', LAB.read(made))
+            sh("ip -n box neigh flush dev box0")
+            time.sleep(1.5)
 
     def test_rules_go_with_the_old_address_gone(self):
         LAB.start_router(secure=False)

@@ -55,7 +55,11 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         result.blStopped = fnStop();
         return result;
     }
-    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});  // it has spoken by now, so that the kernel knows it
+    std::string szHardware = HardwareAddress(Gateway());
+    if (szHardware.empty() && IsNeighbourThere(Gateway(), fnStop)) {  // forgotten, as when the cable was out
+        szHardware = HardwareAddress(Gateway());
+    }
+    mMade.Get().TurnTo({Gateway(), szHardware});
     mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
