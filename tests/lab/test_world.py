@@ -113,6 +113,15 @@ class World(unittest.TestCase):
             sh("ip -n box neigh flush dev box0")
             time.sleep(1.5)
 
+    def test_what_a_router_without_upnp_may_still_forward_is_named(self):
+        LAB.settings(check_interval=1)
+        LAB.start_router()
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        LAB.end(LAB.router)
+        LAB.save()
+        wait_for(lambda: json.loads(LAB.read(PUBLISHED))["left_over"] != [], 30,
+                 "what no rule asks for any more is named")
+
     def test_rules_go_with_the_old_address_gone(self):
         LAB.start_router(secure=False)
         self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)

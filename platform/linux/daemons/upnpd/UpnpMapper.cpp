@@ -2,6 +2,7 @@
 // Promises: see RuleMapper.h.
 #include "daemons/upnpd/UpnpMapper.h"
 
+#include <set>
 #include <utility>
 
 #include "net/Neighbour.h"
@@ -14,6 +15,7 @@ namespace {
 constexpr DaemonNames kNames{
     "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
 constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
+constexpr char kNoIgd[] = "noigd";
 constexpr int kDiscoveryMilliseconds = 8000;
 constexpr int kOutsideMilliseconds = 2000;
 
@@ -49,10 +51,28 @@ void UpnpMapper::Remember() const {
     KeepRouter(Gateway(), {mSzLocation, mHabit.blPermanentOnly});
 }
 
+// A router that maps no ports any more may still forward those that we made.
+void UpnpMapper::NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result) {
+    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});
+    std::set<MappingKey> setWanted;
+    for (const RouterMapping& wanted : rgWanted) {
+        setWanted.insert(KeyOf(wanted));
+    }
+    for (const auto& [key, made] : mMade.Get().Here()) {
+        if (!setWanted.contains(key) && !made.IsSurelyOver(BootSeconds())) {
+            Outcome outcome = OutcomeOf({key.first, key.second, made.nBoxPort, made.szClient, made.szText, 0, true},
+                                        {PortState::kUnknown, kNoIgd});
+            outcome.blLeftOver = true;
+            result.rgOutcomes.push_back(std::move(outcome));
+        }
+    }
+}
+
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     if (!FindRouter(fnStop)) {
-        PassResult result = Failed(rgWanted, "noigd", RouterState::kNoService);
+        PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
         result.blStopped = fnStop();
+        NameLeftOver(rgWanted, result);
         return result;
     }
     std::string szHardware = HardwareAddress(Gateway());

@@ -26,6 +26,7 @@ private:
 
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
+    void NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     std::string mSzLocation;
