@@ -209,6 +209,10 @@ void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
         const Action enAction = StepFor(key, place).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
             blNews = Intend(key, place) || blNews;
+        } else if (enAction == Action::kRenew && MadeAt(key) == nullptr) {  // made before there was a record
+            mRecord.Here()[key] = {
+                mAround.szBox, place.entry.nBoxPort, place.entry.szDescription, true, place.entry.nLease, 0, true};
+            blNews = true;
         }
     }
     if (blNews) {
