@@ -11,6 +11,7 @@
 #include <string>
 
 #include "core/Descriptor.h"
+#include "core/Rename.h"
 #include "core/SysLog.h"
 
 namespace tavo {
@@ -22,10 +23,6 @@ constexpr int kTries = 10;  // against somebody who makes and deletes what is lo
 bool IsOwn(const struct stat& status) {
     return S_ISREG(status.st_mode) && status.st_uid == geteuid() && status.st_nlink == 1 &&
            (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
-}
-
-bool Rename(const std::string& szFrom, const char* szTo, unsigned nFlags) {
-    return renameat2(AT_FDCWD, szFrom.c_str(), AT_FDCWD, szTo, nFlags) == 0;
 }
 
 }  // namespace
@@ -41,7 +38,7 @@ bool MakeOwnFile(const char* szPath) {
         if (Descriptor(mkostemp(szAside.data(), O_CLOEXEC)).Get() < 0) {
             return false;
         }
-        const bool blDone = Rename(szAside, szPath, blThere ? RENAME_EXCHANGE : RENAME_NOREPLACE);
+        const bool blDone = Rename(szAside.c_str(), szPath, blThere ? RENAME_EXCHANGE : RENAME_NOREPLACE);
         const int nErrno = errno;
         if (blDone && blThere) {
             SysLog(LOG_WARNING, "%s was not ours alone; another file stands there now", szPath);

@@ -17,6 +17,7 @@
 
 #include "core/Descriptor.h"
 #include "core/Directory.h"
+#include "core/Rename.h"
 #include "core/Suffix.h"
 #include "core/SysLog.h"
 
@@ -137,7 +138,7 @@ bool BringBack(const char* szPath) {
     if (IsHeld(*newest)) {
         return false;
     }
-    if (renameat2(AT_FDCWD, newest->szPath.c_str(), AT_FDCWD, szPath, RENAME_NOREPLACE) == 0) {
+    if (Rename(newest->szPath.c_str(), szPath, RENAME_NOREPLACE)) {
         SysLog(LOG_WARNING, "%s was missing; its copy %s is back in place", szPath, newest->szPath.c_str());
     }
     return true;

@@ -12,6 +12,7 @@
 
 #include "core/Border.h"
 #include "core/Directory.h"
+#include "core/Rename.h"
 #include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
@@ -141,7 +142,7 @@ std::vector<std::string> Directories(const fs::path& dir) {
 }
 
 void BringBackDatabase() {
-    if (renameat2(AT_FDCWD, kDatabaseAside, AT_FDCWD, kDatabase, RENAME_NOREPLACE) == 0) {
+    if (Rename(kDatabaseAside, kDatabase, RENAME_NOREPLACE)) {
         SysLog(LOG_WARNING, "%s was missing; the one before is back in its place", kDatabase);
     }
 }

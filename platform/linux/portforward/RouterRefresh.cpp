@@ -17,6 +17,7 @@
 #include "core/Border.h"
 #include "core/Descriptor.h"
 #include "core/Directory.h"
+#include "core/Rename.h"
 #include "core/SysLog.h"
 #include "core/TextFile.h"
 #include "portforward/ConfList.h"
@@ -162,26 +163,22 @@ std::optional<std::string> Objection(const fs::path& database) {
     return std::nullopt;
 }
 
-bool Rename(const char* szFrom, const char* szTo, unsigned nFlags) {
-    return renameat2(AT_FDCWD, szFrom, AT_FDCWD, szTo, nFlags) == 0;
-}
-
 // Puts the new database in the old one's place; at every moment, a kill or a power cut leaves one of them whole.
 bool Swap(const fs::path& fresh) {
     const tavo::Descriptor fdFresh(open(fresh.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (fdFresh.Get() < 0 || syncfs(fdFresh.Get()) != 0) {
         return false;
     }
-    if (Rename(fresh.c_str(), kDatabase, RENAME_EXCHANGE)) {
+    if (tavo::Rename(fresh.c_str(), kDatabase, RENAME_EXCHANGE)) {
         return true;  // the old one goes with the scratch
     }
     if (errno == ENOENT) {
-        return Rename(fresh.c_str(), kDatabase, 0);
+        return tavo::Rename(fresh.c_str(), kDatabase, 0);
     }
     // A file system that exchanges nothing: between the two steps, whoever looks brings the old one back.
     std::error_code error;
     fs::remove_all(kDatabaseAside, error);
-    const bool blDone = Rename(kDatabase, kDatabaseAside, 0) && Rename(fresh.c_str(), kDatabase, 0);
+    const bool blDone = tavo::Rename(kDatabase, kDatabaseAside, 0) && tavo::Rename(fresh.c_str(), kDatabase, 0);
     if (blDone) {
         fs::remove_all(kDatabaseAside, error);
     } else {
