@@ -3,9 +3,8 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <ctime>
-#include <fstream>
-#include <string>
 
 namespace tavo {
 
@@ -23,12 +22,9 @@ struct BootClock {
     }
 };
 
-// What tells this boot from every other one, whose times mean nothing here.
-inline std::string BootId() {
-    std::ifstream file("/proc/sys/kernel/random/boot_id");
-    std::string szId;
-    std::getline(file, szId);
-    return szId;
+// Its seconds since the boot.
+inline int64_t BootSeconds() {
+    return std::chrono::duration_cast<std::chrono::seconds>(BootClock::now().time_since_epoch()).count();
 }
 
 }  // namespace tavo

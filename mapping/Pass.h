@@ -3,9 +3,9 @@
 #pragma once
 
 #include <cstdint>
-#include <ctime>
 #include <functional>
 
+#include "mapping/BootClock.h"
 #include "mapping/Outcome.h"
 #include "mapping/Router.h"
 
@@ -20,13 +20,6 @@ struct PassResult {
     bool blRenewed = false;  // every lease was asked for anew, due or not
     RouterState enRouter = RouterState::kNotAsked;
 };
-
-// Seconds of a clock that never jumps and goes on while the box sleeps.
-inline int64_t BootSeconds() {
-    timespec time = {};
-    clock_gettime(CLOCK_BOOTTIME, &time);
-    return time.tv_sec;
-}
 
 class PassGuard {
 public:

@@ -14,6 +14,7 @@
 #include <optional>
 #include <string>
 
+#include "core/BootId.h"
 #include "core/Border.h"
 #include "core/Descriptor.h"
 #include "core/SysLog.h"
@@ -95,10 +96,6 @@ std::string StartOf(const std::string& szPid) {
     return nAt == std::string::npos ? "" : szStat.substr(nAt + 1, szStat.find(' ', nAt + 1) - nAt - 1);
 }
 
-std::string Boot() {
-    return Line("/proc/sys/kernel/random/boot_id");
-}
-
 // Another text after every write of ours, the same after a writer that put the old file back.
 std::string IdentityOf(const struct stat& status) {
     return std::to_string(status.st_ino) + "/" + std::to_string(status.st_size) + "/" +
@@ -121,9 +118,13 @@ Record Now() {
     TAVOPFConfFree(TAVOPFGwRouterConfGet());
     const std::string szPid = std::to_string(getpid());
     const std::string szSystem = IdentityOf(kSystemConf);
-    return {
-        szPid,   StartOf(szPid), Boot(), {IsOn(kNatpmp), IsOn(kUpnp)}, IdentityOf(kRuleConf), IdentityOf(kRouterConf),
-        szSystem};
+    return {szPid,
+            StartOf(szPid),
+            tavo::BootId(),
+            {IsOn(kNatpmp), IsOn(kUpnp)},
+            IdentityOf(kRuleConf),
+            IdentityOf(kRouterConf),
+            szSystem};
 }
 
 // ---- the record --------------------------------------------------------------------------------------------
@@ -178,11 +179,11 @@ std::optional<Record> ReadRecord() {
 
 bool IsOurs(const Record& record) {
     const std::string szPid = std::to_string(getpid());
-    return record.szPid == szPid && record.szStart == StartOf(szPid) && record.szBoot == Boot();
+    return record.szPid == szPid && record.szStart == StartOf(szPid) && record.szBoot == tavo::BootId();
 }
 
 bool IsAlive(const Record& record) {
-    return record.szBoot == Boot() && record.szStart == StartOf(record.szPid);
+    return record.szBoot == tavo::BootId() && record.szStart == StartOf(record.szPid);
 }
 
 // ---- putting back ------------------------------------------------------------------------------------------

@@ -1,28 +1,22 @@
-// The record of what was made at routers, in a file below /var/lib/tavo that only root can read.
-// Relies on the platform's text files and the kernel's name of this boot. Promises: what Save() wrote is there after a
-// crash, however many mappings it is about; a file that is missing is an empty record.
+// The record of what was made at routers, in a file that only root can read. Relies on StateFile and the kernel's name
+// of this boot.
 #pragma once
 
-#include <cstddef>
-#include <string>
-
+#include "core/BootId.h"
+#include "daemons/common/StateFile.h"
 #include "mapping/Record.h"
 
 namespace tavo {
 
-// Some 300 bytes for each port of both protocols, and room for long texts.
-inline constexpr size_t kMostRecordText = 128U << 20U;
-
 class MadeFile {
 public:
-    explicit MadeFile(const char* szPath);
+    explicit MadeFile(const char* szPath)
+        : mFile(szPath, "mappings may outlive a crash", kMostMappingsText), mRecord(mFile.Read(), BootId()) {}
     Record& Get() { return mRecord; }
-    // Writes only what differs from what was written last.
-    void Save();
+    void Save() { mFile.Save(mRecord.Text()); }
 
 private:
-    const char* mSzPath;
-    std::string mSzWritten;
+    StateFile mFile;
     Record mRecord;
 };
 

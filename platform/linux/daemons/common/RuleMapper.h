@@ -11,13 +11,13 @@
 #include <utility>
 #include <vector>
 
-#include "daemons/common/BootClock.h"
 #include "daemons/common/Daemon.h"
 #include "daemons/common/Published.h"
 #include "daemons/common/RouterTurn.h"
 #include "daemons/common/Teller.h"
 #include "daemons/common/ToldFile.h"
 #include "daemons/common/Wanted.h"
+#include "mapping/BootClock.h"
 #include "mapping/Pass.h"
 #include "upnp/Notify.h"
 

@@ -1,22 +1,18 @@
 // Writes and reads what a user has been told. Relies on the platform's text files. Promises: see ToldFile.h.
 #include "daemons/common/ToldFile.h"
 
-#include <sys/stat.h>
-
 #include <algorithm>
 #include <array>
 #include <cstdlib>
 #include <string_view>
 #include <utility>
 
-#include "core/SysLog.h"
 #include "core/TextFile.h"
 
 namespace tavo {
 
 namespace {
 
-constexpr char kStateDir[] = "/var/lib/tavo";
 constexpr char kRouterSection[] = "router";
 constexpr std::string_view kPort = "port ";
 constexpr std::string_view kTimes = "told ";
@@ -130,24 +126,10 @@ Told ParseTold(const std::string& szText) {
 
 Told& ToldFile::Get() {
     if (!mBlRead) {
-        mSzWritten = ReadFile(mSzPath).value_or("");
-        mTold = ParseTold(mSzWritten);
+        mTold = ParseTold(mFile.Read());
         mBlRead = true;
     }
     return mTold;
-}
-
-void ToldFile::Save() {
-    std::string szText = FormatTold(Get());
-    if (szText == mSzWritten) {
-        return;
-    }
-    mkdir(kStateDir, 0755);
-    if (!WriteFileAtomic(mSzPath, szText)) {
-        SysLog(LOG_ERR, "cannot write %s: what was told may be told again", mSzPath.c_str());
-        return;
-    }
-    mSzWritten = std::move(szText);
 }
 
 }  // namespace tavo

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "daemons/common/Notices.h"
+#include "daemons/common/StateFile.h"
 
 namespace tavo {
 
@@ -15,14 +16,14 @@ Told ParseTold(const std::string& szText);
 class ToldFile {
 public:
     // szDaemon: "upnpd", "natpmpd".
-    explicit ToldFile(const std::string& szDaemon) : mSzPath("/var/lib/tavo/" + szDaemon + ".told") {}
+    explicit ToldFile(const std::string& szDaemon)
+        : mFile("/var/lib/tavo/" + szDaemon + ".told", "what was told may be told again") {}
     // Read when it is first asked for: until then another daemon, whose place this one takes, may write it.
     Told& Get();
-    void Save();
+    void Save() { mFile.Save(FormatTold(Get())); }
 
 private:
-    std::string mSzPath;
-    std::string mSzWritten;
+    StateFile mFile;
     bool mBlRead = false;
     Told mTold;
 };

@@ -7,7 +7,7 @@
 #include <cstdint>
 #include <utility>
 
-#include "daemons/common/BootClock.h"
+#include "mapping/BootClock.h"
 
 namespace tavo {
 

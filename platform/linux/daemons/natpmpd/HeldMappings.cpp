@@ -1,24 +1,18 @@
-// Keeps the rows of HeldMappings in a file. Relies on the platform's text files.
+// Keeps the rows of HeldMappings in a file. Relies on StateFile.
 // Promises: see HeldMappings.h.
 #include "daemons/natpmpd/HeldMappings.h"
-
-#include <sys/stat.h>
 
 #include <cstdlib>
 #include <vector>
 
-#include "core/SysLog.h"
+#include "core/BootId.h"
 #include "core/TextFile.h"
-#include "daemons/common/BootClock.h"
-#include "daemons/common/MadeFile.h"
-#include "mapping/Pass.h"
+#include "mapping/BootClock.h"
 
 namespace tavo {
 
 namespace {
 
-constexpr char kStateDir[] = "/var/lib/tavo";
-constexpr char kStateFile[] = "/var/lib/tavo/natpmp_held.conf";
 constexpr char kBootSection[] = "boot";
 constexpr long kMaxPort = 65535;
 
@@ -33,9 +27,8 @@ long Number(const std::string& szText) {
 }  // namespace
 
 void HeldMappings::Load() {
-    mSzWritten = ReadFile(kStateFile, kMostRecordText).value_or("");
     bool blThisBoot = false;
-    for (const Section& section : ParseSections(mSzWritten).value_or(std::vector<Section>())) {
+    for (const Section& section : ParseSections(mFile.Read()).value_or(std::vector<Section>())) {
         std::map<std::string, std::string> mapValues;
         for (const Pair& pair : section.rgPairs) {
             mapValues[pair.szKey] = pair.szValue;
@@ -74,16 +67,7 @@ void HeldMappings::Save() {
                                {"expiry", std::to_string(held.nExpiry)},
                                {"lease", std::to_string(held.nLease)}}});
     }
-    std::string szText = FormatSections(rgSections);
-    if (szText == mSzWritten) {
-        return;
-    }
-    mkdir(kStateDir, 0755);
-    if (!WriteFileAtomic(kStateFile, szText, kPrivateMode, nullptr, kMostRecordText)) {
-        SysLog(LOG_ERR, "cannot write %s: mappings may outlive a crash until they run out", kStateFile);
-        return;
-    }
-    mSzWritten = std::move(szText);
+    mFile.Save(FormatSections(rgSections));
 }
 
 }  // namespace tavo

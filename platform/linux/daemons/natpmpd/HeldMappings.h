@@ -8,6 +8,8 @@
 #include <string>
 #include <tuple>
 
+#include "daemons/common/StateFile.h"
+
 namespace tavo {
 
 // A gateway knows a mapping by the box's address, the protocol and the box's port; so do we.
@@ -42,7 +44,8 @@ public:
 
 private:
     void Load();
-    std::string mSzWritten;
+    StateFile mFile{"/var/lib/tavo/natpmp_held.conf", "mappings may outlive a crash until they run out",
+                    kMostMappingsText};
 };
 
 }  // namespace tavo
