@@ -109,8 +109,8 @@ bool IsReadFailure(int nErr) {
     return nErr == TLIBC_ERR_NO_MEMORY || nErr == TLIBC_ERR_OPEN || nErr == TLIBC_ERR_READ;
 }
 
-// Whether there are settings. A writer of pages that lives has them aside for a moment: the platform's reader waits for
-// it, and "nothing" must not be said before it has looked.
+// Whether there are settings. The platform's reader brings back what a killed writer left, and waits for one of pages
+// that lives and has them aside for a moment: "nothing" must not be said before it has looked.
 bool IsStored() {
     if (TLIBCFileExist(kRouterConf) == 1) {
         return true;
@@ -288,10 +288,12 @@ int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerCo
             !SetIdentity(writer, *routerConf)) {
             return -1;
         }
+        // What FinishStoring() may bring back is left to it: what one before left as ".bak", and what is moved aside.
+        const tavo::lib::HeldFile heldBefore(kRouterConfBak);
         if (IsDaemonRouter(*routerConf)) {
             return FinishStoring(StoreDaemonRouter(writer));
         }
-        const tavo::lib::HeldFile held(kRouterConf);  // what is moved aside comes back by FinishStoring() alone
+        const tavo::lib::HeldFile held(kRouterConf);
         return FinishStoring(StoreManual(writer, szGwRouterIP, *routerConf, pErr));
     });
 }

@@ -76,6 +76,9 @@ public:
     }
 
     bool Move() {
+        if (TLIBCFileExist(kRouterConf) != 1) {  // what a killed writer left takes its place before ours would
+            const tavo::lib::ConfList pList(TAVOPFGwRouterConfGet());
+        }
         mSettings.emplace(kRouterConf);
         if (TLIBCFileExist(kRouterConf) != 1 || rename(kRouterConf, mSzAside.c_str()) == 0) {
             return true;

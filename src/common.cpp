@@ -263,7 +263,7 @@ void OwnerAndMode::GiveTo(const char* szPath) const {
 }
 
 HeldFile::HeldFile(const char* szPath) {
-    if (TLIBCFileExist(szPath) == 1) {  // and back in its place, where somebody was killed before
+    if (TLIBCFileExist(szPath) == 1) {
         mFd = open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
         flock(mFd, LOCK_EX | LOCK_NB);
     }

@@ -1,6 +1,7 @@
 // The stores when something beneath them fails: memory, a full disk, killed writers, several at once.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/file.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -11,6 +12,7 @@
 #include <memory>
 
 #include "InitState.h"
+#include "core/Descriptor.h"
 #include "libtavoportmap.h"
 #include "stage.h"
 #include "tavo/core.h"
@@ -315,7 +317,7 @@ TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
 TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
     const std::string szKilled = std::string(kRouterConf) + ".bak";  // of one before
     for (const auto& [szSupport, szFile] :
-         {std::pair{"no", kRouterConf}, {"no", szKilled.c_str()}, {"yes", kRouterConf}}) {
+         {std::pair{"no", kRouterConf}, {"no", szKilled.c_str()}, {"yes", kRouterConf}, {"yes", szKilled.c_str()}}) {
         std::filesystem::remove(kRouterConf);
         Write(szFile, kOldSettings);
         gFnOnConfSet = [] {
@@ -324,12 +326,37 @@ TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
             return -1;
         };
         CallAndDie({"", szSupport, 1, true});
-        // A failed write of a UPnP router ends with no settings.
-        EXPECT_EQ(Read(kRouterConf), *szSupport == 'n' ? kOldSettings : "");
+        // A failed write of a UPnP router ends with no settings, but for those that one before had left as ".bak".
+        EXPECT_EQ(Read(kRouterConf), *szSupport == 'n' || szFile == szKilled ? kOldSettings : "");
     }
     Write(kRouterConf, kOldSettings);
     gFnOnConfSet = nullptr;
     CallAndDie({"", nullptr, 1, false});
+    EXPECT_EQ(Read(kRouterConf), kOldSettings);
+}
+
+// A copy that a killed writer left is the readers' to bring back: a store that fails must not make it its own first.
+TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
+    gFnOnConfSet = [] { return -1; };
+    for (const char* szSupport : {"yes", "no"}) {
+        for (const char* szSuffix : {"aB3dE6", ".bak"}) {
+            std::filesystem::remove(kRouterConf);
+            Write(std::string(kRouterConf) + szSuffix, kOldSettings);
+            CallAndDie({"", szSupport, 1, true});
+            const auto pConf = std::make_unique<RouterConf>();
+            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), 0) << szSupport << szSuffix;
+            EXPECT_EQ(Read(kRouterConf), kOldSettings) << szSupport << szSuffix;
+        }
+    }
+    gFnOnConfSet = nullptr;
+    // An older tool, while another program holds the settings locked, as one that reads does.
+    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
+    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=0'\n");
+    chmod("/usr/tavo/bin/tavoportforward", 0755);
+    Write(kRouterConf, kOldSettings);
+    const tavo::Descriptor fdForeign(open(kRouterConf, O_RDONLY | O_CLOEXEC));
+    ASSERT_EQ(flock(fdForeign.Get(), LOCK_SH), 0);
+    CallAndDie({"", "no", 0, false});
     EXPECT_EQ(Read(kRouterConf), kOldSettings);
 }
 

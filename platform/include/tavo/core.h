@@ -80,8 +80,8 @@ int TLIBCErrorGetLine(void);
 
 enum { TLIBC_MAX_FILE = 16 << 20 /* bytes of a file; more is neither read nor written */ };
 
-/* 1: something exists at szPath; 0: nothing does (or null). A rule or router file that a killed writer left aside
- * only is put back first (see portforward.h), so that it is missing for nobody. */
+/* 1: something exists at szPath; 0: nothing does (or null). The router settings that a killed report set aside are
+ * put back first (see portforward.h): what it put in their place is nobody's. */
 int TLIBCFileExist(const char* szPath);
 /* Creates an empty file, or updates the times of one that is there. 0: done; -1: failed. */
 int TLIBCFileTouch(const char* szPath);

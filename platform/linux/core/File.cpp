@@ -118,7 +118,7 @@ int TLIBCFileExist(const char* szPath) {
         return 0;
     }
     AtBorder(-1, [szPath] {
-        tavo::MendStore(szPath);
+        tavo::EndReport(szPath);
         return 0;
     });
     return lstat(szPath, &status) == 0 ? 1 : 0;

@@ -26,8 +26,7 @@ namespace tavo {
 namespace {
 
 constexpr std::string_view kRouterName = "router.conf";
-constexpr std::string_view kStores[] = {"/etc/portforward/router.conf", "/etc/portforward/rule.conf",
-                                        "/etc/portforward/testrule.conf"};
+constexpr std::string_view kRouterConf = "/etc/portforward/router.conf";
 constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
 
 enum class Kind {
@@ -144,9 +143,9 @@ bool BringBack(const char* szPath) {
     return true;
 }
 
-void MendStore(const char* szPath) {
-    if (std::find(std::begin(kStores), std::end(kStores), szPath) != std::end(kStores)) {
-        BringBack(szPath);
+void EndReport(const char* szPath) {
+    if (szPath == kRouterConf) {
+        BringBackReported(szPath, AsideCopies(szPath));
     }
 }
 

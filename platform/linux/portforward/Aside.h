@@ -11,8 +11,9 @@ namespace tavo {
 // replaced, but for what a report that was killed put in the place of the settings: they come back from the name and
 // a suffix that begins with a digit. False: there is a copy, and it is left to its owner, who lives.
 bool BringBack(const char* szPath);
-// The same when szPath is one of the rule and router files; any other path is left alone.
-void MendStore(const char* szPath);
+// Only what a killed report set aside, and only of router.conf; any other path is left alone. For whoever is about to
+// write as well: he must not take what a killed writer left for the live file.
+void EndReport(const char* szPath);
 // Deletes copies that a newer file made obsolete (brought back at some later day, they would open ports that nobody
 // asks for any more), and what was half written: either may hold a password. Those of the last ten minutes stay, and so
 // does router.conf.bak, a name that a person might use as well: the next settings that are stored delete it.
