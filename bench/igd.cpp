@@ -7,11 +7,11 @@
 #include <string_view>
 #include <vector>
 
-#include "core/TextFile.h"
-#include "daemons/common/Wanted.h"
+#include "ground/TextFile.h"
 #include "mapping/Carry.h"
+#include "programs/common/Wanted.h"
 #include "tavo/net.h"
-#include "upnp/Igd.h"
+#include "wire/upnp/Igd.h"
 
 namespace {
 

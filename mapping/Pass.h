@@ -5,7 +5,7 @@
 #include <cstdint>
 #include <functional>
 
-#include "mapping/BootClock.h"
+#include "ground/BootClock.h"
 #include "mapping/Outcome.h"
 #include "mapping/Router.h"
 

@@ -5,7 +5,7 @@
 #include <charconv>
 #include <iterator>
 
-#include "core/TextFile.h"
+#include "ground/TextFile.h"
 
 namespace tavo {
 

@@ -38,7 +38,7 @@ enum RouterCode : int {
     kRouterOnlyPermanentLeases = 725
 };
 
-class __attribute__((visibility("default"))) Router {
+class Router {
 public:
     virtual ~Router() = default;
     // Outputs are set only with kRouterOk; with kRouterTooLong, List() has what was read.

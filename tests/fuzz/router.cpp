@@ -14,9 +14,9 @@
 #include <tuple>
 
 #include "mapping/Carry.h"
-#include "daemons/common/Wanted.h"
-#include "upnp/Igd.h"
-#include "upnp/Ssdp.h"
+#include "programs/common/Wanted.h"
+#include "wire/upnp/Igd.h"
+#include "wire/upnp/Search.h"
 
 namespace {
 

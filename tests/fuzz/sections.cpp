@@ -10,7 +10,7 @@
 #include <sstream>
 #include <string>
 
-#include "core/TextFile.h"
+#include "ground/TextFile.h"
 #include "tavo/core.h"
 
 namespace {

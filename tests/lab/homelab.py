@@ -159,7 +159,7 @@ class Lab:
                         "bin/tavohook"):
             if os.path.lexists(f"/usr/tavo/{program}"):
                 os.unlink(f"/usr/tavo/{program}")
-            os.symlink(f"{BUILD}/platform/linux/daemons/{os.path.basename(program)}", f"/usr/tavo/{program}")
+            os.symlink(f"{BUILD}/programs/{os.path.basename(program)}", f"/usr/tavo/{program}")
         self.settings()
         self.router_conf(natpmp)
         self.write("/etc/portforward/router_upnp.db", '[Lab/One/1]\nsupport="yes"\nmax="100"\n')

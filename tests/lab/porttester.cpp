@@ -7,8 +7,8 @@
 #include <cstdlib>
 #include <vector>
 
+#include "ground/ConfList.h"
 #include "libtavoportmap.h"
-#include "portforward/ConfList.h"
 #include "porttest/PortTest.h"
 #include "tavo/porttest.h"
 

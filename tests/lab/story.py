@@ -12,7 +12,7 @@ import networks
 from homelab import BOX, BUILD, GATEWAY, LAN2, WAN, wait_for
 
 TOOL = f"{BUILD}/cli/tavoportmap"
-CHECKD = f"{BUILD}/platform/linux/daemons/tavoportcheckd"
+CHECKD = f"{BUILD}/programs/tavoportcheckd"
 TOKEN, CHECK_PORT = "0123456789abcdef-story", 8099
 FOREIGN = {("tcp", 5001): (LAN2, 5001), ("tcp", 9999): (LAN2, 9999)}
 PROBES = (("tcp", 8443), ("udp", 6001), ("tcp", 5000), ("tcp", 5001), ("udp", 6000))

@@ -13,7 +13,7 @@ LAB = None
 DISABLED, UNKNOWN, OPEN, REFUSED, TIMEOUT, NOLISTEN = range(6)
 TOKEN = "0123456789abcdef-lab"
 CONF = "/etc/tavo/portcheck.conf"
-CHECKD = f"{BUILD}/platform/linux/daemons/tavoportcheckd"
+CHECKD = f"{BUILD}/programs/tavoportcheckd"
 URL = f"http://{WAN}:8099"
 WAN6 = "fd00:203::9"
 

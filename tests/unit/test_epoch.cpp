@@ -1,7 +1,7 @@
 // When a gateway's "seconds since start" says that it has lost its mappings.
 #include <gtest/gtest.h>
 
-#include "daemons/natpmpd/EpochWatch.h"
+#include "programs/natpmpd/EpochWatch.h"
 
 namespace {
 

@@ -12,7 +12,7 @@
 #include <memory>
 
 #include "InitState.h"
-#include "core/Descriptor.h"
+#include "ground/Descriptor.h"
 #include "libtavoportmap.h"
 #include "stage.h"
 #include "tavo/core.h"

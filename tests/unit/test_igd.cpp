@@ -7,12 +7,12 @@
 #include <set>
 #include <tuple>
 
-#include "daemons/common/MadeFile.h"
-#include "daemons/common/TestMappings.h"
 #include "mapping/Carry.h"
-#include "upnp/Igd.h"
-#include "upnp/Notify.h"
-#include "upnp/Ssdp.h"
+#include "programs/common/MadeFile.h"
+#include "programs/upnpd/TestMappings.h"
+#include "wire/upnp/Igd.h"
+#include "wire/upnp/Notify.h"
+#include "wire/upnp/Search.h"
 
 namespace {
 

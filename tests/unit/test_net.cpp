@@ -4,7 +4,7 @@
 
 #include <chrono>
 
-#include "net/Level.h"
+#include "ground/net/Level.h"
 #include "tavo/net.h"
 #include "world.h"
 

@@ -4,8 +4,8 @@
 
 #include <sstream>
 
-#include "daemons/common/Teller.h"
-#include "daemons/common/ToldFile.h"
+#include "programs/common/Teller.h"
+#include "programs/common/ToldFile.h"
 
 namespace {
 

@@ -11,11 +11,11 @@
 #include <functional>
 #include <thread>
 
-#include "core/SysLog.h"
-#include "core/TextFile.h"
-#include "daemons/common/Wanted.h"
-#include "daemons/tavohook/Hooks.h"
-#include "portforward/PortText.h"
+#include "ground/PortText.h"
+#include "ground/SysLog.h"
+#include "ground/TextFile.h"
+#include "programs/common/Wanted.h"
+#include "programs/tavohook/Hooks.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 #include "world.h"

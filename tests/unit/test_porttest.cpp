@@ -4,10 +4,10 @@
 
 #include <filesystem>
 
-#include "daemons/tavoportcheckd/Limits.h"
-#include "porttest/Checker.h"
 #include "porttest/RuleVerdict.h"
+#include "programs/tavoportcheckd/Limits.h"
 #include "tavo/porttest.h"
+#include "wire/portcheck/Checker.h"
 #include "world.h"
 
 namespace {

@@ -3,7 +3,7 @@
 
 #include <chrono>
 
-#include "daemons/common/SignalQueue.h"
+#include "programs/common/SignalQueue.h"
 
 namespace {
 

@@ -12,10 +12,10 @@
 #include <cstring>
 #include <memory>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
 #include "core/RunKeys.h"
-#include "core/TextFile.h"
+#include "ground/Border.h"
+#include "ground/Descriptor.h"
+#include "ground/TextFile.h"
 #include "portforward/Aside.h"
 #include "tavo/core.h"
 

@@ -7,7 +7,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "core/Border.h"
+#include "ground/Border.h"
 #include "tavo/core.h"
 
 namespace {

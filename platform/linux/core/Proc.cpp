@@ -16,11 +16,11 @@
 #include <string>
 #include <vector>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "core/Spawn.h"
-#include "core/TextFile.h"
-#include "core/Unit.h"
+#include "ground/Border.h"
+#include "ground/Descriptor.h"
+#include "ground/Spawn.h"
+#include "ground/TextFile.h"
+#include "ground/Unit.h"
 #include "tavo/core.h"
 
 extern char** environ;

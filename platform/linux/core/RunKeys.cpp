@@ -14,11 +14,12 @@
 #include <optional>
 #include <string>
 
-#include "core/BootId.h"
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "core/SysLog.h"
-#include "core/TextFile.h"
+#include "ground/BootId.h"
+#include "ground/Border.h"
+#include "ground/Descriptor.h"
+#include "ground/Paths.h"
+#include "ground/SysLog.h"
+#include "ground/TextFile.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 #include "tavo/runkeys.h"
@@ -28,10 +29,10 @@ namespace {
 using tavo::AtBorder;
 using tavo::Descriptor;
 using tavo::kRouterLock;
+using tavo::kStateDir;
 using tavo::ReadFile;
 
 constexpr char kRecord[] = "/var/lib/tavo/run_keys.conf";
-constexpr char kDirectory[] = "/var/lib/tavo";
 constexpr mode_t kDirectoryMode = 0755;
 constexpr off_t kMaxRecord = 4096;
 constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
@@ -284,7 +285,7 @@ int TAVORunKeysRemember() {
         if (const int nMended = before && IsOurs(*before) ? 0 : MendLocked(); nMended != 0) {
             return nMended;
         }
-        if (mkdir(kDirectory, kDirectoryMode) != 0 && errno != EEXIST) {
+        if (mkdir(kStateDir, kDirectoryMode) != 0 && errno != EEXIST) {
             return -1;
         }
         if (!OwnText()) {

@@ -6,8 +6,6 @@
 
 namespace tavo {
 
-inline constexpr char kRouterLock[] = "/tmp/routerconf.lock";  // of saves and detections
-
 // Notes a new file that is about to take the place of szPath as the noted operation's own, where this process, or
 // the one that forked it, is at one. False: it is, and the note cannot be made: the file must not take its place.
 bool NoteWrite(std::string_view szPath, int fdNew);

@@ -5,8 +5,8 @@
 #include <string>
 #include <string_view>
 
-#include "core/Border.h"
-#include "core/Unit.h"
+#include "ground/Border.h"
+#include "ground/Unit.h"
 #include "tavo/core.h"
 
 namespace {

@@ -3,12 +3,11 @@
 #include <sys/stat.h>
 
 #include <string>
-#include <utility>
 
-#include "core/Border.h"
-#include "core/TextFile.h"
-#include "log/Catalogue.h"
-#include "log/LogFile.h"
+#include "ground/Border.h"
+#include "ground/Catalogue.h"
+#include "ground/LogFile.h"
+#include "ground/TextFile.h"
 #include "tavo/log.h"
 
 namespace {
@@ -35,32 +34,7 @@ const char* LevelName(int nLevel) {
     }
 }
 
-constexpr std::pair<unsigned, const char*> kCatalogue[] = {
-    {TAVO_EVENT_PF_CONFLICT, "The router already uses these ports for something else: "},
-    {TAVO_EVENT_PF_ADD_FAILED, "The router refused to forward these ports: "},
-    {TAVO_EVENT_PF_PORT_LOST, "Lost on the router: "},
-    {TAVO_EVENT_PF_PORT_REFUSED, "Refused by the router: "},
-    {TAVO_EVENT_PF_PORT_BACK, "Open on the router now: "},
-    {TAVO_EVENT_PF_ROUTER_GONE, "The router is gone: "},
-    {TAVO_EVENT_PF_ROUTER_BACK, "The router is back: "},
-    {TAVO_EVENT_PF_ROUTER_REPLACED, "The router is another one: "},
-    {TAVO_EVENT_PF_ADDRESS_CHANGED, "The outside address has changed: "},
-    {TAVO_EVENT_PF_RENEWED, "The router had lost these ports, and has them again: "}};
-
 }  // namespace
-
-namespace tavo {
-
-const char* EventMessage(unsigned nEvent) {
-    for (const auto& [nKnown, szMessage] : kCatalogue) {
-        if (nKnown == nEvent) {
-            return szMessage;
-        }
-    }
-    return "Event: ";
-}
-
-}  // namespace tavo
 
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4) {

@@ -2,9 +2,9 @@
 // Promises: see tavo/log.h.
 #include <string>
 
-#include "core/Border.h"
-#include "core/TextFile.h"
-#include "log/LogFile.h"
+#include "ground/Border.h"
+#include "ground/LogFile.h"
+#include "ground/TextFile.h"
 #include "tavo/log.h"
 
 namespace {

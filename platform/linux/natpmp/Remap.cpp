@@ -3,8 +3,8 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "core/Border.h"
-#include "core/TextFile.h"
+#include "ground/Border.h"
+#include "ground/TextFile.h"
 #include "tavo/natpmp.h"
 
 namespace {

@@ -11,7 +11,7 @@
 #include <optional>
 #include <vector>
 
-#include "core/Border.h"
+#include "ground/Border.h"
 #include "tavo/net.h"
 
 namespace {

@@ -11,15 +11,15 @@
 #include <cstring>
 #include <string>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "natpmp/PublicAddress.h"
-#include "net/Level.h"
-#include "net/Neighbour.h"
-#include "net/Outside.h"
-#include "net/Walk.h"
+#include "ground/Border.h"
+#include "ground/Descriptor.h"
+#include "ground/net/Level.h"
+#include "ground/net/Neighbour.h"
+#include "platform/linux/net/Reachability.h"
 #include "tavo/net.h"
-#include "upnp/Known.h"
+#include "wire/icmp/HopProbe.h"
+#include "wire/pcp/PublicAddress.h"
+#include "wire/upnp/GatewayMemory.h"
 
 namespace {
 

@@ -15,9 +15,9 @@
 #include <cstring>
 #include <optional>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "net/Netlink.h"
+#include "ground/Border.h"
+#include "ground/Descriptor.h"
+#include "ground/net/Netlink.h"
 
 namespace {
 

@@ -15,11 +15,11 @@
 #include <string_view>
 #include <vector>
 
-#include "core/Descriptor.h"
-#include "core/Directory.h"
-#include "core/Rename.h"
-#include "core/Suffix.h"
-#include "core/SysLog.h"
+#include "ground/Descriptor.h"
+#include "ground/Directory.h"
+#include "ground/Rename.h"
+#include "ground/Suffix.h"
+#include "ground/SysLog.h"
 
 namespace tavo {
 

@@ -10,13 +10,13 @@
 #include <memory>
 #include <new>
 
-#include "core/Border.h"
-#include "core/Directory.h"
-#include "core/Rename.h"
-#include "core/SysLog.h"
-#include "core/TextFile.h"
-#include "portforward/ConfList.h"
-#include "portforward/RouterScript.h"
+#include "ground/Border.h"
+#include "ground/ConfList.h"
+#include "ground/Directory.h"
+#include "ground/Rename.h"
+#include "ground/RouterScript.h"
+#include "ground/SysLog.h"
+#include "ground/TextFile.h"
 
 namespace fs = std::filesystem;
 

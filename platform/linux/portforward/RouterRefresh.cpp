@@ -14,15 +14,15 @@
 #include <optional>
 #include <string_view>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "core/Directory.h"
-#include "core/Rename.h"
-#include "core/SysLog.h"
-#include "core/TextFile.h"
-#include "portforward/ConfList.h"
+#include "ground/Border.h"
+#include "ground/ConfList.h"
+#include "ground/Descriptor.h"
+#include "ground/Directory.h"
+#include "ground/Rename.h"
+#include "ground/RouterScript.h"
+#include "ground/SysLog.h"
+#include "ground/TextFile.h"
 #include "portforward/RouterDatabase.h"
-#include "portforward/RouterScript.h"
 
 namespace fs = std::filesystem;
 

@@ -10,7 +10,7 @@
 #include <map>
 #include <set>
 
-#include "core/Descriptor.h"
+#include "ground/Descriptor.h"
 
 namespace tavo {
 

@@ -12,12 +12,12 @@
 #include <iterator>
 #include <optional>
 
-#include "core/Descriptor.h"
+#include "ground/Descriptor.h"
 #include "porttest/Arrivals.h"
-#include "porttest/Checker.h"
 #include "porttest/Responder.h"
 #include "tavo/net.h"
 #include "tavo/porttest.h"
+#include "wire/portcheck/Checker.h"
 
 namespace tavo {
 

@@ -6,8 +6,7 @@
 
 #include <vector>
 
-#include "core/Export.h"
-#include "portforward/PortText.h"
+#include "ground/PortText.h"
 #include "porttest/RuleVerdict.h"
 
 namespace tavo {
@@ -26,6 +25,6 @@ struct PortQuestion {
 // UDP: OPEN when the probe arrived. A port that a program has is UNKNOWN, as nobody knows its protocol. No
 // arrival is TIMEOUT only when another probe arrived in the same test, so that UDP from the checker is known to
 // get through; else UNKNOWN.
-TAVO_PLATFORM_API std::vector<PortVerdict> TestPorts(const std::vector<PortQuestion>& rgQuestions);
+std::vector<PortVerdict> TestPorts(const std::vector<PortQuestion>& rgQuestions);
 
 }  // namespace tavo

@@ -12,7 +12,7 @@
 #include <charconv>
 #include <string_view>
 
-#include "porttest/Protocol.h"
+#include "wire/portcheck/Protocol.h"
 
 namespace tavo {
 

@@ -13,7 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "core/Descriptor.h"
+#include "ground/Descriptor.h"
 
 namespace tavo {
 

@@ -5,8 +5,6 @@
 #include <string>
 #include <vector>
 
-#include "core/Export.h"
-
 namespace tavo {
 
 struct PortVerdict {
@@ -26,6 +24,6 @@ bool IsWorse(int enStatus, int enThan);
 // The worst status, and as reason every reason with its ports, the worst first: "5001/tcp, 5003/tcp: connection
 // refused; 5002/tcp: open". nLeftOut: further ports of the rule, of which nothing is known. No ports at all:
 // unknown, without a reason.
-TAVO_PLATFORM_API PortVerdict MergeVerdicts(std::vector<NamedVerdict> rgVerdicts, size_t nLeftOut);
+PortVerdict MergeVerdicts(std::vector<NamedVerdict> rgVerdicts, size_t nLeftOut);
 
 }  // namespace tavo

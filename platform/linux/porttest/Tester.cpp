@@ -8,10 +8,10 @@
 #include <cerrno>
 #include <cstdio>
 
-#include "core/Border.h"
-#include "core/Descriptor.h"
-#include "core/SysLog.h"
-#include "portforward/ConfList.h"
+#include "ground/Border.h"
+#include "ground/ConfList.h"
+#include "ground/Descriptor.h"
+#include "ground/SysLog.h"
 #include "porttest/PortTest.h"
 #include "porttest/RuleVerdict.h"
 #include "tavo/porttest.h"

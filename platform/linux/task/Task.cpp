@@ -11,13 +11,13 @@
 #include <new>
 #include <sstream>
 
-#include "core/Border.h"
-#include "core/TextFile.h"
+#include "ground/Border.h"
+#include "ground/Paths.h"
+#include "ground/TextFile.h"
 
 namespace {
 
 constexpr char kFile[] = "platform/linux/task/Task.cpp";
-constexpr char kStateDirectory[] = "/var/lib/tavo";
 constexpr char kTaskDirectory[] = "/var/lib/tavo/tasks";
 constexpr char kSuffix[] = ".json";
 constexpr mode_t kDirectoryMode = 0755;
@@ -27,6 +27,7 @@ constexpr size_t kMaxRecord = 1U << 20U;
 constexpr int kMaxDepth = 2;  // an object of texts
 
 using tavo::AtBorder;
+using tavo::kStateDir;
 using Properties = std::map<std::string, std::string>;
 
 int Fail(int nErr, int nLine) {
@@ -119,7 +120,7 @@ struct Task::Impl {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
         for (const std::string& szDirectory :
-             {std::string(kStateDirectory), std::string(kTaskDirectory), OwnerDirectory(szOwner)}) {
+             {std::string(kStateDir), std::string(kTaskDirectory), OwnerDirectory(szOwner)}) {
             MakeDirectory(szDirectory);
         }
         return tavo::WriteFileAtomic(szPath, szText, kRecordMode) ? 1 : 0;

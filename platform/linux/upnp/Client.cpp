@@ -10,9 +10,9 @@
 #include <optional>
 #include <set>
 
-#include "core/Border.h"
+#include "ground/Border.h"
 #include "tavo/upnp.h"
-#include "upnp/Known.h"
+#include "wire/upnp/GatewayMemory.h"
 
 namespace {
 

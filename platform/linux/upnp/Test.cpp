@@ -9,14 +9,14 @@
 #include <cstdlib>
 #include <memory>
 
-#include "core/Border.h"
-#include "core/TextFile.h"
+#include "ground/Border.h"
+#include "ground/TextFile.h"
 #include "porttest/PortTest.h"
 #include "tavo/log.h"
 #include "tavo/porttest.h"
 #include "tavo/upnptest.h"
-#include "upnp/Known.h"
-#include "upnp/TestRules.h"
+#include "wire/upnp/GatewayMemory.h"
+#include "wire/upnptest/TestRules.h"
 
 namespace {
 

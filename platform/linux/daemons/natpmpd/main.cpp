@@ -1,9 +1,0 @@
-// natpmpd: keeps the router's NAT-PMP port mappings in line with the box's rules.
-// Relies on the frame of the daemons and on NatpmpMapper. Promises: one instance; see --help.
-#include "daemons/common/Daemon.h"
-#include "daemons/natpmpd/NatpmpMapper.h"
-
-int main(int argc, char** argv) {
-    tavo::NatpmpMapper mapper;
-    return tavo::DaemonMain(argc, argv, mapper);
-}

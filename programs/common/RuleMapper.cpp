@@ -1,0 +1,297 @@
+// The common mapping side of the daemons. Relies on Wanted, RouterTurn and the platform's addresses.
+// Promises: see RuleMapper.h.
+#include "programs/common/RuleMapper.h"
+
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <ctime>
+#include <utility>
+
+#include "ground/SysLog.h"
+#include "ground/TextFile.h"
+#include "ground/net/Neighbour.h"
+#include "tavo/core.h"
+#include "tavo/net.h"
+#include "tavo/runkeys.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr mode_t kResultMode = 0644;
+constexpr int kFailuresToRediscover = 3;
+constexpr int kRetrySeconds = 10;
+constexpr int kWithdrawTries = 3;
+constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
+constexpr size_t kAddressSize = 16;
+constexpr int kPassesToOutside = 5;
+constexpr char kNoAddress[] = "0.0.0.0";  // how a router says that it has none
+constexpr char kNoLink[] = "the network cable is out, or the network is down";
+
+int Setting(const char* szSection, const char* szKey, const char* szDefault, int nLeast, int nMost) {
+    char szValue[16];
+    TLIBPlatformSettingGet(szSection, szKey, szDefault, szValue, sizeof(szValue));
+    return static_cast<int>(std::clamp<long>(std::strtol(szValue, nullptr, 10), nLeast, nMost));
+}
+
+// The gateway, the address that faces it, and whether the link is up: nothing else of the network concerns us, and a
+// box with containers has much else.
+std::string NetworkInSight() {
+    char szGateway[kAddressSize] = {};
+    char szBox[kAddressSize] = {};
+    char szInterface[kAddressSize] = {};
+    const bool blGateway = TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) == 0 &&
+                           TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) == 0;
+    const bool blLink = checkGwIfEnable(szInterface, sizeof(szInterface)) == 0;
+    return std::string(blGateway ? szGateway : "") + " " + (blGateway ? szBox : "") + (blLink ? " up" : " down");
+}
+
+}  // namespace
+
+RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
+    : mNames(names), mBlRequestRenews(blRequestRenews), mTold(names.szName) {
+    ReadSettings();
+}
+
+void RuleMapper::ReadSettings() {
+    mNCheckSeconds = Setting(mNames.szName, "check_interval", "120", 1, 3600);
+    mNWishedLease = static_cast<uint32_t>(Setting(mNames.szName, "lease", "3600", 20, 604800));
+}
+
+// Whether the run key has come back: a save or a detection that was killed leaves it off.
+bool RuleMapper::MendRunKeys() {
+    const bool blWasOn = IsSwitchedOn();
+    mBlMended = TAVORunKeysMend() == 0;
+    return !blWasOn && IsSwitchedOn();
+}
+
+void RuleMapper::ReadRules() {
+    unlink(mNames.szResultFile);  // what it says belongs to an older request
+    WantedSet wanted = ReadWanted(mNames.szRunKey);
+    if (wanted.blReadable) {
+        mWanted = std::move(wanted);
+        mBlRulesRead = true;
+    } else {
+        mWanted.blReadable = false;
+        mWanted.blSwitchedOn = wanted.blSwitchedOn;
+        SysLog(LOG_ERR, "the rule file cannot be read; the router's mappings stay as they are");
+    }
+}
+
+// False: there is no gateway. A gateway or an own address that has changed makes all begin anew.
+bool RuleMapper::FindGateway() {
+    char szGateway[kAddressSize] = {};
+    char szBox[kAddressSize] = {};
+    const bool blFound = TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) == 0 &&
+                         TAVONetLocalAddressGet(szGateway, szBox, sizeof(szBox), nullptr, 0) == 0;
+    if (!blFound) {
+        szGateway[0] = '\0';
+    }
+    if (mSzGateway != szGateway || mSzBox != szBox) {
+        mSzGateway = szGateway;
+        mSzBox = szBox;
+        mNLease = 0;
+        mNUntilOutside = 0;
+        mSzOutside.clear();
+        if (blFound) {
+            mAnnouncements.Listen(mSzBox);
+        }
+        NewGateway();
+    }
+    return blFound;
+}
+
+// A daemon that is switched off and does not have the turn has nothing at the router to take away: it
+// gave the turn back only after that.
+bool RuleMapper::TakeTurn(const std::function<bool()>& fnStop) {
+    const auto end = BootClock::now() + kTurnLimit;
+    return mTurn.Take([&] { return IsSwitchedOn() && !fnStop() && BootClock::now() < end; });
+}
+
+bool RuleMapper::OnNetworkChange() {
+    std::string szNow = NetworkInSight();
+    return std::exchange(mSzNetwork, szNow) != szNow;
+}
+
+PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter) {
+    const PortState enState = enRouter == RouterState::kBusy ? PortState::kWaiting : PortState::kUnknown;
+    PassResult result;
+    for (const RouterMapping& wanted : rgWanted) {
+        result.rgOutcomes.push_back(OutcomeOf(wanted, {enState, szWord}));
+    }
+    result.nTransport = kRouterUnreachable;
+    result.enRouter = enRouter;
+    return result;
+}
+
+PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnStop) {
+    if (!TakeTurn(fnStop)) {
+        const bool blSwitchedOn = IsSwitchedOn();
+        PassResult result =
+            Failed(mWanted.rgMappings, "busy", blSwitchedOn ? RouterState::kBusy : RouterState::kNotAsked);
+        result.nTransport = blSwitchedOn ? kRouterTimeout : kRouterOk;
+        result.blStopped = fnStop();
+        return result;
+    }
+    if (!mBlRulesRead) {
+        return {};  // not knowing the rules is no reason to take anything away
+    }
+    if (!FindGateway()) {
+        return Failed(mWanted.rgMappings, "nogateway", RouterState::kNoGateway);
+    }
+    const auto now = BootClock::now();
+    const bool blDue = mNLease != 0 && now - mRenewed >= std::chrono::seconds(mNLease / 2);
+    const bool blRenew = blDue || (blRequested && mBlRequestRenews);
+    PassResult result = Map(mWanted.rgMappings, blRenew, fnStop);
+    if (result.nTransport == kRouterOk && !result.blStopped) {
+        mRenewed = blRenew || result.blRenewed || mNLease == 0 ? now : mRenewed;
+        mNLease = result.nShortestLease;
+    }
+    return result;
+}
+
+int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
+    blRequested = MendRunKeys() || blRequested;
+    mSzNetwork = NetworkInSight();
+    if (blRequested) {
+        ReadSettings();
+        ReadRules();
+    }
+    PassResult result = Pass(blRequested, fnStop);
+    AddRules(result.rgOutcomes);
+    if (!result.blStopped) {
+        WriteResults(result.rgOutcomes);
+        if (!IsSwitchedOn()) {
+            mTurn.GiveBack();
+        }
+    }
+    const int nSeconds = SecondsToNext(result);
+    if (!result.blStopped) {
+        PublishPass(std::move(result), blRequested, nSeconds, fnStop);
+    }
+    return nSeconds;
+}
+
+int RuleMapper::SecondsToNext(const PassResult& result) {
+    if (result.nTransport != kRouterOk) {
+        if (++mNFailures >= kFailuresToRediscover) {
+            mNFailures = 0;
+            mNLease = 0;
+            LostRouter();
+        }
+        return std::min(mNCheckSeconds, kRetrySeconds);
+    }
+    mNFailures = 0;
+    if (!mBlMended) {
+        return std::min(mNCheckSeconds, kRetrySeconds);
+    }
+    if (result.nNextSeconds > 0) {
+        return std::min(mNCheckSeconds, result.nNextSeconds);
+    }
+    if (mNLease == 0) {
+        return mNCheckSeconds;
+    }
+    const auto left = mRenewed + std::chrono::seconds(mNLease / 2) - BootClock::now();
+    const auto nLeft = std::chrono::ceil<std::chrono::seconds>(left).count();
+    return static_cast<int>(std::clamp<int64_t>(nLeft, 1, mNCheckSeconds));
+}
+
+// What the rules themselves say of the outcomes: whose they are, and what was not asked of the router at all.
+void RuleMapper::AddRules(OutcomeList& rgOutcomes) const {
+    for (Outcome& outcome : rgOutcomes) {
+        const auto it = mWanted.mapRules.find(outcome.szName);
+        outcome.szRule = it == mWanted.mapRules.end() || outcome.blLeftOver ? "" : it->second;
+    }
+    rgOutcomes.insert(rgOutcomes.end(), mWanted.rgRefused.begin(), mWanted.rgRefused.end());
+}
+
+void RuleMapper::WriteResults(const OutcomeList& rgOutcomes) const {
+    OutcomeList rgAll = rgOutcomes;
+    if (!mWanted.blReadable) {
+        rgAll.push_back({"rule.conf", {PortState::kUnknown, "unreadable"}});
+    }
+    const std::string szText = ResultText(rgAll);
+    // A box that has nothing to do lets its disks sleep.
+    if (ReadFile(mNames.szResultFile) != szText && !WriteFileAtomic(mNames.szResultFile, szText, kResultMode)) {
+        SysLog(LOG_ERR, "cannot write %s", mNames.szResultFile);
+    }
+}
+
+// Tells a router that is not there from one that does not do what it is asked for.
+void RuleMapper::LookAtRouter(Published& state, const std::function<bool()>& fnStop) {
+    const bool blLost = state.enRouter == RouterState::kNoService || state.enRouter == RouterState::kSilent;
+    char szInterface[kAddressSize];
+    const bool blLink = (!blLost && state.enRouter != RouterState::kNoGateway) ||
+                        checkGwIfEnable(szInterface, sizeof(szInterface)) == 0;
+    if (blLost && (!blLink || !IsNeighbourThere(mSzGateway, fnStop))) {
+        state.enRouter = RouterState::kUnreachable;
+    }
+    state.szRouterWhy = blLink ? WhyOf(state.enRouter, mNames.szProtocol) : kNoLink;
+    state.szHardware = HardwareAddress(mSzGateway);
+}
+
+// Every few passes, and as soon as the router is back.
+void RuleMapper::AskOutside(const std::function<bool()>& fnStop) {
+    if (--mNUntilOutside > 0) {
+        return;
+    }
+    mNUntilOutside = kPassesToOutside;
+    mSzOutside = Outside(fnStop);
+    if (mSzOutside == kNoAddress) {
+        mSzOutside.clear();
+    }
+}
+
+void RuleMapper::PublishPass(PassResult result, bool blRequested, int nSecondsToNext,
+                             const std::function<bool()>& fnStop) {
+    Published state{mNames.szName, mNames.szProtocol};
+    state.blSwitchedOn = IsSwitchedOn();
+    state.blRulesReadable = mWanted.blReadable;
+    state.szGateway = mSzGateway;
+    state.szBox = mSzBox;
+    state.enRouter = result.enRouter;
+    state.rgOutcomes = std::move(result.rgOutcomes);
+    LookAtRouter(state, fnStop);
+    if (state.enRouter == RouterState::kOk) {
+        AskOutside(fnStop);
+    } else {
+        mNUntilOutside = 0;
+    }
+    state.szOutside = mSzOutside;
+    state.nAt = std::time(nullptr);
+    state.nNextLook = state.nAt + nSecondsToNext;
+    NoteSince(mTold.Get(), state);
+    Publish(state);
+    TellNews(state, blRequested);
+}
+
+void RuleMapper::TellNews(const Published& state, bool blRequested) {
+    if (!mWanted.blSwitchedOn) {
+        mTold.Get() = Told();         // whoever maps now tells what there is to tell
+    } else if (state.blSwitchedOn) {  // a save switches it off for a moment
+        for (const Notice& notice : Compare(mTold.Get(), state, blRequested)) {
+            mTeller.Tell(notice, state);
+        }
+    }
+    mTold.Save();
+}
+
+bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
+    Unpublish(mNames.szName);
+    if (!mTurn.Take([] { return false; })) {
+        return true;  // without the turn, nothing was made
+    }
+    for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
+        const PassResult result = Map({}, false, fnStop);
+        if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
+            mTold.Get().blWithdrawn = true;
+            mTold.Save();
+            return true;
+        }
+    }
+    return false;
+}
+
+}  // namespace tavo

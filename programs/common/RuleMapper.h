@@ -1,0 +1,97 @@
+// What the mapping side of both daemons does alike: rules, results, the gateway and the box's address, the
+// clock of checks, renewals and retries. Relies on the settings, the rule file and the platform's addresses;
+// the protocol is spoken by the class derived from it.
+// Promises: the result file is removed when a request begins and complete when its pass has ended; what is known
+// is published after each pass, and what has changed is told; the router is spoken to only while the other daemon does
+// not.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "ground/BootClock.h"
+#include "mapping/Pass.h"
+#include "programs/common/Daemon.h"
+#include "programs/common/Published.h"
+#include "programs/common/RouterTurn.h"
+#include "programs/common/Teller.h"
+#include "programs/common/ToldFile.h"
+#include "programs/common/Wanted.h"
+#include "wire/upnp/Notify.h"
+
+namespace tavo {
+
+class RuleMapper : public Mapper {
+public:
+    const DaemonNames& Names() const final { return mNames; }
+    int Run(bool blRequested, const std::function<bool()>& fnStop) final;
+    bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
+    bool Withdraw(const std::function<bool()>& fnStop) final;
+    bool OnNetworkChange() final;
+    std::vector<int> WakeFds() const override { return {mAnnouncements.Fd()}; }
+    // The gateway has begun anew, by what it announces as a UPnP device, which most are whatever maps ports there.
+    bool OnWake() override { return mAnnouncements.TakeNews(mSzGateway); }
+
+protected:
+    // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked
+    // what it has.
+    RuleMapper(const DaemonNames& names, bool blRequestRenews);
+
+    // Brings the router in line. blRenew: leases are due.
+    virtual PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+                           const std::function<bool()>& fnStop) = 0;
+    // The result file's text, of names and words of all that was asked for; "1" is success.
+    virtual std::string ResultText(const OutcomeList& rgOutcomes) const = 0;
+    // The router's address on its other side; empty when it does not say.
+    virtual std::string Outside(const std::function<bool()>& fnStop) = 0;
+    // The gateway or the box's own address is another one: nothing of what was known holds.
+    virtual void NewGateway() = 0;
+    // Several passes in a row have failed.
+    virtual void LostRouter() {}
+
+    // What a pass that failed as a whole says of each mapping.
+    static PassResult Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter);
+
+    const std::string& Gateway() const { return mSzGateway; }
+    const std::string& Box() const { return mSzBox; }
+    uint32_t WishedLease() const { return mNWishedLease; }
+
+private:
+    bool MendRunKeys();
+    void ReadSettings();
+    void ReadRules();
+    bool FindGateway();
+    bool TakeTurn(const std::function<bool()>& fnStop);
+    PassResult Pass(bool blRequested, const std::function<bool()>& fnStop);
+    void AddRules(OutcomeList& rgOutcomes) const;
+    void WriteResults(const OutcomeList& rgOutcomes) const;
+    int SecondsToNext(const PassResult& result);
+    void LookAtRouter(Published& state, const std::function<bool()>& fnStop);
+    void AskOutside(const std::function<bool()>& fnStop);
+    void PublishPass(PassResult result, bool blRequested, int nSecondsToNext, const std::function<bool()>& fnStop);
+    void TellNews(const Published& state, bool blRequested);
+
+    const DaemonNames& mNames;
+    bool mBlRequestRenews;
+    int mNCheckSeconds = 0;
+    uint32_t mNWishedLease = 0;
+    WantedSet mWanted;
+    bool mBlRulesRead = false;
+    bool mBlMended = false;  // no killed save or detection has left our run key off
+    Announcements mAnnouncements;
+    std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
+    RouterTurn mTurn;
+    std::string mSzGateway;
+    std::string mSzBox;
+    int mNFailures = 0;
+    uint32_t mNLease = 0;  // seconds that the router grants
+    BootClock::time_point mRenewed;
+    std::string mSzOutside;
+    int mNUntilOutside = 0;  // passes until the router is asked for it again
+    ToldFile mTold;
+    Teller mTeller;
+};
+
+}  // namespace tavo

@@ -1,0 +1,31 @@
+// What a user has been told, kept over restarts of a daemon and of the box. Relies on a sectioned file below
+// /var/lib/tavo. Promises: a file that is missing or damaged is "nothing told yet"; nothing is written that has not
+// changed.
+#pragma once
+
+#include <string>
+
+#include "programs/common/Notices.h"
+#include "programs/common/StateFile.h"
+
+namespace tavo {
+
+std::string FormatTold(const Told& told);
+Told ParseTold(const std::string& szText);
+
+class ToldFile {
+public:
+    // szDaemon: "upnpd", "natpmpd".
+    explicit ToldFile(const std::string& szDaemon)
+        : mFile("/var/lib/tavo/" + szDaemon + ".told", "what was told may be told again") {}
+    // Read when it is first asked for: until then another daemon, whose place this one takes, may write it.
+    Told& Get();
+    void Save() { mFile.Save(FormatTold(Get())); }
+
+private:
+    StateFile mFile;
+    bool mBlRead = false;
+    Told mTold;
+};
+
+}  // namespace tavo

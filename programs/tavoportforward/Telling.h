@@ -1,0 +1,28 @@
+// What a run came to, told to everybody who asks: the system log, the event log and /run/tavo/tavoportforward.json.
+// Relies on the published state that the daemons share. Promises: each forward that is not in place is named with
+// the reason.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "mapping/Outcome.h"
+#include "programs/tavoportforward/Jobs.h"
+
+namespace tavo {
+
+struct RunResult {
+    std::string szGateway = {};
+    std::string szBox = {};
+    RouterState enRouter = RouterState::kNotAsked;
+    std::string szRouterWhy = {};  // of what concerns the router as a whole
+    bool blRulesReadable = true;
+    std::vector<Job> rgWanted = {};  // what the router was asked for
+    std::vector<Refusal> rgRefusals = {};
+};
+
+void Tell(const RunResult& result);
+// The same for a run that could not try anything: of each rule nobody knows what the router does.
+void TellNotTried(RunResult result, const std::string& szWhy);
+
+}  // namespace tavo

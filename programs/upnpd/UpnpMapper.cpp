@@ -1,0 +1,127 @@
+// Keeps the gateway's UPnP mappings in line with the rules. Relies on the IGD client and the mapping core.
+// Promises: see RuleMapper.h.
+#include "programs/upnpd/UpnpMapper.h"
+
+#include <set>
+#include <utility>
+
+#include "ground/net/Neighbour.h"
+#include "wire/upnp/GatewayMemory.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr DaemonNames kNames{
+    "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
+constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
+constexpr char kNoIgd[] = "noigd";
+constexpr int kDiscoveryMilliseconds = 8000;
+constexpr int kOutsideMilliseconds = 2000;
+
+}  // namespace
+
+UpnpMapper::UpnpMapper() : RuleMapper(kNames, false), mMade(kMadeFile) {}
+
+void UpnpMapper::NewGateway() {
+    mPIgd.reset();
+    KnownRouter known = RecallRouter(Gateway());
+    mSzLocation = std::move(known.szLocation);
+    mHabit.blPermanentOnly = known.blPermanentOnly;
+}
+
+void UpnpMapper::LostRouter() {
+    mPIgd.reset();
+    mSzLocation.clear();
+}
+
+// Where does the router's service live. False: there is none that we can use.
+bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
+    if (mPIgd == nullptr) {
+        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation, 0, fnStop);
+        if (mPIgd != nullptr) {
+            Remember();
+        }
+    }
+    return mPIgd != nullptr;
+}
+
+// What worked is tried first the next time, also after a restart.
+void UpnpMapper::Remember() const {
+    KeepRouter(Gateway(), {mSzLocation, mHabit.blPermanentOnly});
+}
+
+// A router that maps no ports any more may still forward those that we made.
+void UpnpMapper::NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result) {
+    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});
+    std::set<MappingKey> setWanted;
+    for (const RouterMapping& wanted : rgWanted) {
+        setWanted.insert(KeyOf(wanted));
+    }
+    for (const auto& [key, made] : mMade.Get().Here()) {
+        if (!setWanted.contains(key) && !made.IsSurelyOver(BootSeconds())) {
+            Outcome outcome = OutcomeOf({key.first, key.second, made.nBoxPort, made.szClient, made.szText, 0, true},
+                                        {PortState::kUnknown, kNoIgd});
+            outcome.blLeftOver = true;
+            result.rgOutcomes.push_back(std::move(outcome));
+        }
+    }
+}
+
+PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
+    if (!FindRouter(fnStop)) {
+        PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
+        result.blStopped = fnStop();
+        NameLeftOver(rgWanted, result);
+        return result;
+    }
+    std::string szHardware = HardwareAddress(Gateway());
+    if (szHardware.empty() && IsNeighbourThere(Gateway(), fnStop)) {  // forgotten, as when the cable was out
+        szHardware = HardwareAddress(Gateway());
+    }
+    mMade.Get().TurnTo({Gateway(), szHardware});
+    mMade.Get().Prune(BootSeconds());
+    mPIgd->SetStop(fnStop);
+    mHabit.nLease = WishedLease();
+    const bool blPermanentOnly = mHabit.blPermanentOnly;
+    PassResult result =
+        BringInLine(*mPIgd, rgWanted, mMade.Get(), mHabit, {Box(), BootSeconds, fnStop, [this] { mMade.Save(); }});
+    result.enRouter = result.nTransport == kRouterOk ? RouterState::kOk : RouterState::kSilent;
+    if (blPermanentOnly != mHabit.blPermanentOnly) {
+        Remember();
+    }
+    return result;
+}
+
+// The record knows what is due.
+PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool /*blRenew*/,
+                           const std::function<bool()>& fnStop) {
+    const PassResult result = MapOnce(rgWanted, fnStop);
+    // A router that restarted often has its service at another port: look for it at once.
+    if (result.nTransport == kRouterUnreachable && mPIgd != nullptr && !result.blStopped) {
+        LostRouter();
+        return MapOnce(rgWanted, fnStop);
+    }
+    return result;
+}
+
+std::string UpnpMapper::ResultText(const OutcomeList& rgOutcomes) const {
+    std::string szText;
+    for (const Outcome& outcome : rgOutcomes) {
+        szText += outcome.szName + (outcome.blLeftOver ? " (left over)=" : "=") + outcome.verdict.szWord + "\n";
+    }
+    return szText;
+}
+
+std::string UpnpMapper::Outside(const std::function<bool()>& fnStop) {
+    std::string szAddress;
+    if (mPIgd != nullptr) {
+        mPIgd->SetStop(fnStop);
+        mPIgd->SetCallLimit(kOutsideMilliseconds);
+        mPIgd->ExternalAddress(szAddress);
+        mPIgd->SetCallLimit(kRequestMilliseconds);
+    }
+    return szAddress;
+}
+
+}  // namespace tavo
