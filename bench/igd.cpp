@@ -7,8 +7,10 @@
 #include <string_view>
 #include <vector>
 
+#include "ground/Marks.h"
 #include "ground/TextFile.h"
 #include "mapping/Carry.h"
+#include "programs/common/IgdRouter.h"
 #include "programs/common/Wanted.h"
 #include "tavo/net.h"
 #include "wire/upnp/Igd.h"
@@ -37,24 +39,25 @@ using tavo::RouterMapping;
 class BenchRouter : public tavo::Router {
 public:
     explicit BenchRouter(tavo::Igd& igd) : mIgd(igd) {}
-    int List(std::vector<RouterMapping>& rgMappings) override { return Shown(mIgd.List(rgMappings), rgMappings); }
-    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                  std::vector<RouterMapping>& rgMappings) override {
+    tavo::Abilities What() const override { return mIgd.What(); }
+    tavo::RouterReply List(std::vector<RouterMapping>& rgMappings) override {
+        return Shown(mIgd.List(rgMappings), rgMappings);
+    }
+    tavo::RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                                std::vector<RouterMapping>& rgMappings) override {
         return Shown(mIgd.ListRange(szProtocol, nFirst, nLast, rgMappings), rgMappings);
     }
-    int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override {
-        const int nCode = mIgd.Get(szProtocol, nRouterPort, mapping);
+    tavo::RouterReply Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override {
+        tavo::RouterReply reply = mIgd.Get(szProtocol, nRouterPort, mapping);
         Show(mapping);
-        return nCode;
+        return reply;
     }
-    int Add(const RouterMapping& mapping) override {
+    tavo::RouterReply Add(RouterMapping& mapping) override {
         RouterMapping sent = mapping;
         Exchange(sent.szDescription, tavo::kOwnPrefix, kBenchPrefix);
         return mIgd.Add(sent);
     }
-    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override {
-        return mIgd.Remove(szProtocol, nRouterPort);
-    }
+    tavo::RouterReply Remove(const RouterMapping& mapping) override { return mIgd.Remove(mapping); }
 
 private:
     static bool Exchange(std::string& szText, std::string_view szFrom, std::string_view szTo) {
@@ -69,14 +72,14 @@ private:
             Exchange(mapping.szDescription, kBenchPrefix, tavo::kOwnPrefix);
         }
     }
-    static int Shown(int nCode, std::vector<RouterMapping>& rgMappings) {
+    static tavo::RouterReply Shown(tavo::RouterReply reply, std::vector<RouterMapping>& rgMappings) {
         for (RouterMapping& mapping : rgMappings) {
             Show(mapping);
         }
-        return nCode;
+        return reply;
     }
 
-    tavo::Igd& mIgd;
+    tavo::IgdRouter mIgd;
 };
 
 void PrintTime(const char* szWhat, Clock::time_point start) {
@@ -85,9 +88,9 @@ void PrintTime(const char* szWhat, Clock::time_point start) {
 
 int List(tavo::Igd& igd) {
     std::vector<RouterMapping> rgMappings;
-    const int nCode = igd.List(rgMappings);
-    if (nCode != tavo::kRouterOk) {
-        std::fprintf(stderr, "tavo-igd: the router answered %s\n", tavo::CodeText(nCode).c_str());
+    const tavo::RouterReply reply = tavo::IgdRouter(igd).List(rgMappings);
+    if (!reply.IsOk()) {
+        std::fprintf(stderr, "tavo-igd: the router answered %s\n", reply.szWord.c_str());
         return 1;
     }
     for (const RouterMapping& mapping : rgMappings) {
@@ -103,7 +106,7 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
         const auto nPort = static_cast<uint16_t>(kFirstPort + i);
         rgWanted.push_back({"TCP", nPort, nPort, "", std::string(tavo::kOwnPrefix) + "igd", 0, true});
     }
-    tavo::LeaseHabit habit;
+    tavo::Habits habit;
     BenchRouter router(igd);
     // As upnpd remembers what it made.
     tavo::Record record(tavo::ReadFile(kRecord).value_or(""), "bench");
@@ -118,7 +121,7 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
             ++nMissing;
         }
     }
-    return nMissing == 0 && result.nTransport == tavo::kRouterOk ? 0 : 1;
+    return nMissing == 0 && result.transport.IsOk() ? 0 : 1;
 }
 
 }  // namespace

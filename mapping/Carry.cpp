@@ -36,14 +36,17 @@ struct Place {
     RouterMapping entry = {};
     bool blWritten = false;   // asked for in this pass, and not read back yet
     bool blReplaced = false;  // taken away, because the router said yes to a change and did not make it
-    int nKept = kRouterOk;    // the router's code for what it did not take away
+    RouterReply kept = {};    // the router's word for what it did not take away
+    RouterReply answer = {};  // to the last asking for it
+    const char* szWhy = "";   // it was asked for
     Verdict verdict = {};
 };
 
 class Pass {
 public:
-    Pass(Router& router, Record& record, LeaseHabit& habit, const Surroundings& around)
+    Pass(Router& router, Record& record, Habits& habit, const Surroundings& around)
         : mRouter(router),
+          mAbilities(router.What()),
           mRecord(record),
           mHabit(habit),
           mAround(around),
@@ -53,12 +56,13 @@ public:
 
 private:
     bool IsOver() { return mGuard.IsOver(); }
-    int Note(int nCode);
+    RouterReply Note(RouterReply reply);
     Made* MadeAt(const MappingKey& key);
     Step StepFor(const MappingKey& key, const Place& place);
     void Show(const RouterMapping& entry);
     void LookAtTable();
-    int Look(const MappingKey& key, Place& place);
+    RouterReply Look(const MappingKey& key, Place& place);
+    void Recall();
     void LookAt(const std::vector<MappingKey>& rgKeys);
     void TakeAway(const std::vector<MappingKey>& rgKeys);
     bool Remove(const MappingKey& key, Place& place);
@@ -67,20 +71,26 @@ private:
     void Bring(const std::vector<MappingKey>& rgKeys);
     void Settle(const MappingKey& key, Place& place);
     bool Do(const MappingKey& key, Place& place, const Step& step);
+    bool Renew(const MappingKey& key, Place& place);
     bool Add(const MappingKey& key, Place& place, bool blAnew);
-    void OnRefused(const MappingKey& key, Place& place, int nCode);
+    void OnMade(const MappingKey& key, Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew);
+    void OnElsewhere(const MappingKey& key, Place& place, const RouterMapping& made, const RouterReply& reply);
+    uint16_t OlderPlace(const MappingKey& key, uint16_t nBoxPort) const;
+    void OnRefused(const MappingKey& key, Place& place, const RouterReply& reply);
     void ShowRanges();
     void ReadBack();
     void Confirm(const MappingKey& key, Place& place);
     Verdict Open(const MappingKey& key, const Place& place);
     Verdict InTheWay(const RouterMapping& entry) const;
-    Verdict StillHeld(const MappingKey& key, int nCode);
+    Verdict StillHeld(const MappingKey& key, const RouterReply& reply);
+    RouterMapping Known(const MappingKey& key, const Place& place);
     void Wake(int64_t nAt) { mNNext = std::min(mNNext, nAt); }
     void Conclude(const std::vector<RouterMapping>& rgWanted);
 
     Router& mRouter;
+    const Abilities mAbilities;
     Record& mRecord;
-    LeaseHabit& mHabit;
+    Habits& mHabit;
     const Surroundings& mAround;
     std::map<MappingKey, Place> mMapPlaces;
     std::vector<MappingKey> mRgWritten;  // to be read back
@@ -91,9 +101,9 @@ private:
     int64_t mNNext = kNever;
 };
 
-int Pass::Note(int nCode) {
-    mBlSense = mBlSense || nCode == kRouterOk || nCode == kRouterNoSuchEntry || nCode == kRouterConflict;
-    return mGuard.Note(nCode);
+RouterReply Pass::Note(RouterReply reply) {
+    mBlSense = mBlSense || reply.IsOk() || reply.enReply == Reply::kNoSuchEntry || reply.enReply == Reply::kConflict;
+    return mGuard.Note(std::move(reply));
 }
 
 Made* Pass::MadeAt(const MappingKey& key) {
@@ -104,7 +114,11 @@ Made* Pass::MadeAt(const MappingKey& key) {
 Step Pass::StepFor(const MappingKey& key, const Place& place) {
     const PlaceView view{place.pWanted, place.enSeen, place.enSeen == Seen::kPresent ? &place.entry : nullptr,
                          MadeAt(key)};
-    return Decide(view, mAround.szBox, mAround.fnNow());
+    Step step = Decide(view, mAround.szBox, mAround.fnNow(), mAbilities.blLeases);
+    if (step.enAction == Action::kChange && !mAbilities.blShows) {
+        step.enAction = Action::kReplace;  // nobody could see what came of it
+    }
+    return step;
 }
 
 // Takes in what the router shows at a place. What it shows of ours is how we know it from then on.
@@ -136,15 +150,32 @@ void Pass::LookAtTable() {
     }
 }
 
-int Pass::Look(const MappingKey& key, Place& place) {
-    RouterMapping entry;
-    const int nCode = Note(mRouter.Get(key.first, key.second, entry));
-    if (nCode == kRouterOk) {
-        Show(entry);
-    } else if (nCode > kRouterOk) {
-        place.enSeen = nCode == kRouterNoSuchEntry ? Seen::kAbsent : Seen::kHidden;
+// A router that shows nothing: what it has granted, and what has not run out since, is what there is while it answers.
+void Pass::Recall() {
+    std::vector<RouterMapping> rgNone;
+    if (RouterReply reply = Note(mRouter.List(rgNone)); reply.IsSilence()) {
+        mResult.transport = std::move(reply);
     }
-    return nCode;
+    for (auto& [key, place] : mMapPlaces) {
+        const Made* pMade = MadeAt(key);
+        const bool blThere = pMade != nullptr && pMade->blShown && mAround.fnNow() < pMade->End();
+        place.enSeen = blThere ? Seen::kPresent : Seen::kHidden;
+        if (blThere) {
+            place.entry = Known(key, place);
+        }
+    }
+    mBlSense = true;
+}
+
+RouterReply Pass::Look(const MappingKey& key, Place& place) {
+    RouterMapping entry;
+    RouterReply reply = Note(mRouter.Get(key.first, key.second, entry));
+    if (reply.IsOk()) {
+        Show(entry);
+    } else if (reply.IsRefusal()) {
+        place.enSeen = reply.enReply == Reply::kNoSuchEntry ? Seen::kAbsent : Seen::kHidden;
+    }
+    return reply;
 }
 
 void Pass::LookAt(const std::vector<MappingKey>& rgKeys) {
@@ -158,14 +189,14 @@ void Pass::LookAt(const std::vector<MappingKey>& rgKeys) {
 
 // True when it is gone.
 bool Pass::Remove(const MappingKey& key, Place& place) {
-    const int nCode = Note(mRouter.Remove(key.first, key.second));
-    if (nCode == kRouterOk || nCode == kRouterNoSuchEntry) {
+    RouterReply reply = Note(mRouter.Remove(Known(key, place)));
+    if (reply.IsOk() || reply.enReply == Reply::kNoSuchEntry) {
         place.enSeen = Seen::kAbsent;
-        place.nKept = kRouterOk;
+        place.kept = {};
         mRecord.Here().erase(key);
         return true;
     }
-    place.nKept = nCode;
+    place.kept = std::move(reply);
     return false;
 }
 
@@ -176,10 +207,13 @@ void Pass::TakeAway(const std::vector<MappingKey>& rgKeys) {
         if (IsOver()) {
             return;
         }
-        const Action enAction = StepFor(key, place).enAction;
-        if (enAction == Action::kRemove || enAction == Action::kReplace) {
-            Remove(key, place);
-        } else if (enAction == Action::kForget) {
+        const Step step = StepFor(key, place);
+        if (step.enAction == Action::kRemove || step.enAction == Action::kReplace) {
+            const RouterMapping gone = Known(key, place);
+            if (Remove(key, place)) {
+                mAround.fnTell(gone, step);
+            }
+        } else if (step.enAction == Action::kForget) {
             mRecord.Here().erase(key);
         }
     }
@@ -247,27 +281,24 @@ void Pass::Settle(const MappingKey& key, Place& place) {
 bool Pass::Do(const MappingKey& key, Place& place, const Step& step) {
     switch (step.enAction) {
         case Action::kLook:
-            return Look(key, place) >= kRouterOk;
+            return !Look(key, place).IsSilence();
         case Action::kAdd:
+            place.szWhy = step.szWhy;
             return Add(key, place, true);
         case Action::kRenew:
-            Add(key, place, false);
-            if (!place.blWritten) {  // the lease runs on
-                place.verdict = {PortState::kOpen, "1", {}, place.entry.nLease};
-                Wake(mAround.fnNow() + kRenewAgain);
-            }
-            return false;
+            return Renew(key, place);
         case Action::kChange:
+            place.szWhy = step.szWhy;
             Add(key, place, true);
             if (place.blWritten || IsOver()) {
                 return false;
             }
             [[fallthrough]];
         case Action::kReplace:
-            if (place.nKept == kRouterOk && Remove(key, place)) {
+            if (place.kept.IsOk() && Remove(key, place)) {
                 return true;
             }
-            place.verdict = StillHeld(key, place.nKept);
+            place.verdict = StillHeld(key, place.kept);
             return false;
         case Action::kKeep:
             if (MadeAt(key) == nullptr) {  // made before there was a record; its age is not known
@@ -288,45 +319,119 @@ bool Pass::Do(const MappingKey& key, Place& place, const Step& step) {
     }
 }
 
+// True: what is known of the place has changed.
+bool Pass::Renew(const MappingKey& key, Place& place) {
+    const Made* pMade = MadeAt(key);
+    const bool blDoubtful = !mAbilities.blShows && (pMade == nullptr || pMade->blBefore);
+    const bool blAgain = Add(key, place, false);
+    if (!place.blWritten && MadeAt(key) != nullptr) {  // the lease runs on, where there is one
+        place.verdict = blDoubtful ? Refusal(place.answer) : Verdict{PortState::kOpen, "1", {}, place.entry.nLease};
+        Wake(mAround.fnNow() + kRenewAgain);
+    }
+    return blAgain;
+}
+
 // Asks for what is wanted at a place. True: what is known of the place has changed, and is to be decided anew.
 bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
+    if (const auto it = mHabit.mapElsewhere.find(key); it != mHabit.mapElsewhere.end()) {
+        place.verdict = Refusal({Reply::kElsewhere, it->second});
+        mRecord.Here().erase(key);
+        return false;
+    }
+    if (const uint16_t nOlder = OlderPlace(key, place.pWanted->nBoxPort); nOlder != 0) {
+        place.verdict = {PortState::kWaiting, "the router has not closed port " + std::to_string(nOlder) + " yet"};
+        Wake(mAround.fnNow() + kAskAgain);
+        return false;
+    }
     RouterMapping mapping = *place.pWanted;
     mapping.szClient = mAround.szBox;
     if (blAnew && Intend(key, place)) {  // what nobody knew before: the router did not answer at first
         mAround.fnSave();
     }
     const int64_t nAsked = mAround.fnNow();
-    const int nCode = Note(AddWithLease(mRouter, mapping, mHabit));
-    if (Made* pMade = MadeAt(key); nCode < kRouterOk && mapping.nLease == 0 && pMade != nullptr) {
+    const RouterReply& reply = place.answer = Note(AddWithLease(mRouter, mapping, mHabit));
+    if (Made* pMade = MadeAt(key); reply.IsSilence() && mapping.nLease == 0 && pMade != nullptr) {
         pMade->nLease = 0;  // it may be there by now, without the lease that was asked for at first
     }
-    if (nCode == kRouterOk) {
-        // Some say yes to a change, and leave the entry as it was.
-        const uint16_t nBefore = place.enSeen == Seen::kPresent && blAnew ? place.entry.nBoxPort : uint16_t{0};
-        mRecord.Here()[key] = {mAround.szBox, mapping.nBoxPort, mapping.szDescription, false, mapping.nLease, nAsked,
-                               false,         nBefore};
-        place.enSeen = Seen::kUnknown;
-        place.blWritten = true;
-        place.verdict = {PortState::kOpen, kWritten};
-        place.verdict.blAnew = blAnew;
-        mRgWritten.push_back(key);
+    if (reply.IsOk()) {
+        OnMade(key, place, mapping, nAsked, blAnew);
+        return false;
+    }
+    if (reply.enReply == Reply::kElsewhere) {
+        OnElsewhere(key, place, mapping, reply);
         return false;
     }
     if (blAnew) {
-        OnRefused(key, place, nCode);
+        OnRefused(key, place, reply);
     }
-    if (nCode != kRouterConflict || place.enSeen == Seen::kPresent) {
+    if (reply.enReply != Reply::kConflict || place.enSeen == Seen::kPresent) {
         return false;
     }
     // The listing did not show who is in the way. A router that guards its entries does not even show them now.
-    return Look(key, place) == kRouterOk;
+    return Look(key, place).IsOk();
+}
+
+void Pass::OnMade(const MappingKey& key, Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew) {
+    // Some say yes to a change, and leave the entry as it was.
+    const bool blChange = mAbilities.blShows && place.enSeen == Seen::kPresent && blAnew;
+    mRecord.Here()[key] = {mAround.szBox,
+                           mapping.nBoxPort,
+                           mapping.szDescription,
+                           !mAbilities.blShows,
+                           mapping.nLease,
+                           nAsked,
+                           false,
+                           blChange ? place.entry.nBoxPort : uint16_t{0}};
+    if (blAnew) {
+        mAround.fnTell(mapping, {Action::kAdd, place.szWhy});
+    }
+    place.blWritten = true;
+    place.verdict = {PortState::kOpen, kWritten};
+    place.verdict.blAnew = blAnew;
+    if (mAbilities.blShows) {
+        place.enSeen = Seen::kUnknown;
+        mRgWritten.push_back(key);
+        return;
+    }
+    place.enSeen = Seen::kPresent;
+    place.entry = mapping;
+    place.verdict = Open(key, place);
+    place.verdict.blAnew = blAnew;
+}
+
+// The router opened a port that nobody asked for: it is closed before anything else is done.
+void Pass::OnElsewhere(const MappingKey& key, Place& place, const RouterMapping& made, const RouterReply& reply) {
+    mRecord.Here().erase(key);
+    place.enSeen = Seen::kHidden;
+    place.verdict = Refusal(reply);
+    Place& other = mMapPlaces[KeyOf(made)];
+    mRecord.Here()[KeyOf(made)] = {mAround.szBox, made.nBoxPort, made.szDescription,
+                                   true,          made.nLease,   mAround.fnNow()};
+    other.enSeen = Seen::kPresent;
+    other.entry = made;
+    if (Remove(KeyOf(made), other)) {
+        mAround.fnTell(made, {Action::kRemove, "the router made it instead of another one"});
+        mHabit.mapElsewhere[key] = reply.szWord;
+    }
+}
+
+// Another place that may still have the port of the box, at a router that would take away the one with the other. 0:
+// none.
+uint16_t Pass::OlderPlace(const MappingKey& key, uint16_t nBoxPort) const {
+    for (const auto& [other, made] : mRecord.Here()) {
+        const bool blSame = other.first == key.first && made.nBoxPort == nBoxPort && made.szClient == mAround.szBox;
+        if (mAbilities.blByBoxPort && blSame && other != key) {
+            return other.second;
+        }
+    }
+    return 0;
 }
 
 // What was refused is not there, unless it was before.
-void Pass::OnRefused(const MappingKey& key, Place& place, int nCode) {
-    place.verdict = Refusal(nCode);
+void Pass::OnRefused(const MappingKey& key, Place& place, const RouterReply& reply) {
+    place.verdict = Refusal(reply);
     const Made* pMade = MadeAt(key);
-    if (nCode > kRouterOk && place.enSeen == Seen::kAbsent && pMade != nullptr && !pMade->blShown) {
+    if (reply.IsRefusal() && place.enSeen == Seen::kAbsent && pMade != nullptr && !pMade->blShown) {
         mRecord.Here().erase(key);
     }
 }
@@ -343,8 +448,7 @@ void Pass::ShowRanges() {
         });
         if (end - first >= kRangeFrom) {
             std::vector<RouterMapping> rgShown;
-            blShows =
-                Note(mRouter.ListRange(first->first, first->second, std::prev(end)->second, rgShown)) == kRouterOk;
+            blShows = Note(mRouter.ListRange(first->first, first->second, std::prev(end)->second, rgShown)).IsOk();
             for (const RouterMapping& entry : rgShown) {
                 Show(entry);
             }
@@ -369,16 +473,16 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
     const auto fnServes = [&] {
         return place.enSeen == Seen::kPresent && Serves(place.entry, *place.pWanted, mAround.szBox);
     };
-    int nCode = kRouterOk;
+    RouterReply reply;
     if (!fnServes()) {
-        nCode = IsOver() ? mResult.nTransport : Look(key, place);
+        reply = IsOver() ? mResult.transport : Look(key, place);
     }
     place.blWritten = false;
     if (fnServes()) {
         place.verdict = Open(key, place);
         place.verdict.blAnew = blAnew;
-    } else if (IsOver() || (nCode != kRouterOk && nCode != kRouterNoSuchEntry)) {
-        place.verdict = Refusal(nCode);
+    } else if (IsOver() || (!reply.IsOk() && reply.enReply != Reply::kNoSuchEntry)) {
+        place.verdict = Refusal(reply);
     } else if (place.enSeen == Seen::kPresent && IsOurs(place.entry, MadeAt(key), mAround.szBox) &&
                !std::exchange(place.blReplaced, true) && Remove(key, place)) {
         place.verdict = {PortState::kRefused, kLost};
@@ -388,7 +492,7 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
         mRecord.Here().erase(key);
     } else {
         place.verdict = {PortState::kRefused, kLost};
-        if (nCode == kRouterNoSuchEntry) {
+        if (reply.enReply == Reply::kNoSuchEntry) {
             mRecord.Here().erase(key);
         }
     }
@@ -396,23 +500,28 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
 
 // A mapping that the router showed.
 Verdict Pass::Open(const MappingKey& key, const Place& place) {
+    Verdict verdict{PortState::kOpen, "1", {}, place.entry.nLease};
     if (const Made* pMade = MadeAt(key); pMade != nullptr && pMade->nLease != 0) {
         Wake(pMade->nAsked + pMade->nLease / 2);
+        if (pMade->nLease / 2 < kLeastPause) {
+            verdict.szWhy = "the router lends it for " + std::to_string(pMade->nLease) +
+                            " seconds at a time, so that it is closed now and then";
+        }
     }
-    return {PortState::kOpen, "1", {}, place.entry.nLease};
+    return verdict;
 }
 
 // A mapping that cannot be made because of another entry, and whose that is.
 Verdict Pass::InTheWay(const RouterMapping& entry) const {
-    Verdict verdict = Refusal(kRouterConflict);
+    Verdict verdict = Refusal({Reply::kConflict, mAbilities.szConflict});
     verdict.holder = Holder{entry.szClient, HarmlessText(entry.szDescription, kMaxDescription)};
     verdict.blOthers = entry.szClient == mAround.szBox;
     return verdict;
 }
 
 // Ours, and the router does not take it away: from whom it belongs to, which this box is no more, until its lease ends.
-Verdict Pass::StillHeld(const MappingKey& key, int nCode) {
-    Verdict verdict = Refusal(nCode);
+Verdict Pass::StillHeld(const MappingKey& key, const RouterReply& reply) {
+    Verdict verdict = Refusal(reply);
     const Made* pMade = MadeAt(key);
     if (pMade == nullptr) {
         return verdict;
@@ -429,16 +538,27 @@ Verdict Pass::StillHeld(const MappingKey& key, int nCode) {
     return verdict;
 }
 
+// What is known of what is at a place: what the router shows, else what was asked for.
+RouterMapping Pass::Known(const MappingKey& key, const Place& place) {
+    const Made* pMade = MadeAt(key);
+    if (pMade == nullptr || (place.enSeen == Seen::kPresent && !place.entry.szProtocol.empty())) {
+        return place.entry;
+    }
+    const auto nLeft = static_cast<uint32_t>(std::clamp<int64_t>(pMade->End() - mAround.fnNow(), 0, UINT32_MAX));
+    return {key.first, key.second, pMade->nBoxPort, pMade->szClient, pMade->szText, nLeft, true};
+}
+
 void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     const bool blAsked = !mMapPlaces.empty();
-    if (blAsked && !mBlSense && mResult.nTransport == kRouterOk && !mResult.blStopped) {
-        mResult.nTransport = kRouterGarbage;  // codes, and nothing but codes: it is looked for anew in the end
+    if (blAsked && !mBlSense && mResult.transport.IsOk() && !mResult.blStopped) {
+        mResult.transport = {Reply::kGarbage,
+                             "garbage"};  // codes, and nothing but codes: it is looked for anew in the end
     }
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = mMapPlaces[KeyOf(wanted)];
         if (place.verdict.szWord.empty()) {
-            const bool blLost = mResult.nTransport == kRouterOk && !mResult.blStopped;
-            place.verdict = Refusal(blLost ? int{kRouterTimeout} : mResult.nTransport);
+            const bool blLost = mResult.transport.IsOk() && !mResult.blStopped;
+            place.verdict = Refusal(blLost ? RouterReply{Reply::kTimeout, "timeout"} : mResult.transport);
         }
         if (place.verdict.enState == PortState::kUnknown) {
             Wake(mAround.fnNow() + kAskAgain);
@@ -451,11 +571,8 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
         if (place.pWanted != nullptr || (!blThere && pMade == nullptr)) {
             continue;
         }
-        RouterMapping left = place.entry;
-        if (!blThere) {
-            left = {key.first, key.second, pMade->nBoxPort, pMade->szClient, pMade->szText, 0, true};
-        }
-        Outcome outcome = OutcomeOf(left, StillHeld(key, place.nKept == kRouterOk ? mResult.nTransport : place.nKept));
+        const RouterMapping left = Known(key, place);
+        Outcome outcome = OutcomeOf(left, StillHeld(key, place.kept.IsOk() ? mResult.transport : place.kept));
         outcome.blLeftOver = true;
         outcome.verdict.nLease = blThere ? left.nLease : outcome.verdict.nLease;
         mResult.rgOutcomes.push_back(std::move(outcome));
@@ -476,7 +593,7 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     }
     mNReadBack = mAround.fnNow();
     mAround.fnSave();  // what could not be written before
-    LookAtTable();
+    mAbilities.blShows ? LookAtTable() : Recall();
     std::vector<MappingKey> rgUnwanted;
     for (const auto& [key, place] : mMapPlaces) {
         if (place.pWanted == nullptr) {
@@ -501,40 +618,29 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
 
 }  // namespace
 
-std::string CodeText(int nCode) {
-    switch (nCode) {
-        case kRouterOk:
-            return "stopped";
-        case kRouterTimeout:
-        case kRouterTooLong:
-            return "timeout";
-        case kRouterUnreachable:
-            return "unreachable";
-        case kRouterGarbage:
-            return "garbage";
-        default:
-            return std::to_string(nCode);
-    }
-}
-
-Verdict Refusal(int nCode) {
-    return {nCode > 0 ? PortState::kRefused : nCode == 0 ? PortState::kWaiting : PortState::kUnknown, CodeText(nCode)};
+Verdict Refusal(const RouterReply& reply) {
+    const PortState enState = reply.IsRefusal() ? PortState::kRefused
+                              : reply.IsOk()    ? PortState::kWaiting
+                                                : PortState::kUnknown;
+    return {enState, reply.IsOk() ? "stopped" : reply.szWord};
 }
 
 // Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
-int AddWithLease(Router& router, RouterMapping& mapping, LeaseHabit& habit) {
+RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) {
+    const RouterMapping wanted = mapping;
     mapping.nLease = habit.blPermanentOnly ? 0 : habit.nLease;
-    int nCode = router.Add(mapping);
-    if (mapping.nLease != 0 && (nCode == kRouterOnlyPermanentLeases || nCode == kRouterInvalidArgs)) {
-        const bool blSaysSo = nCode == kRouterOnlyPermanentLeases;
+    RouterReply reply = router.Add(mapping);
+    if (mapping.nLease != 0 && (reply.enReply == Reply::kOnlyPermanent || reply.enReply == Reply::kBadArguments)) {
+        const bool blSaysSo = reply.enReply == Reply::kOnlyPermanent;
+        mapping = wanted;
         mapping.nLease = 0;
-        nCode = router.Add(mapping);
-        habit.blPermanentOnly = habit.blPermanentOnly || (nCode == kRouterOk || blSaysSo);
+        reply = router.Add(mapping);
+        habit.blPermanentOnly = habit.blPermanentOnly || (reply.IsOk() || blSaysSo);
     }
-    return nCode;
+    return reply;
 }
 
-PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWanted, Record& record, LeaseHabit& habit,
+PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& habit,
                        const Surroundings& around) {
     return Pass(router, record, habit, around).Run(rgWanted);
 }

@@ -12,12 +12,10 @@
 namespace tavo {
 
 struct PassResult {
-    OutcomeList rgOutcomes;       // those of the wanted mappings first, in their order
-    uint32_t nShortestLease = 0;  // seconds granted; 0: all permanent
-    int nTransport = kRouterOk;   // below 0: why the router could not be spoken to
+    OutcomeList rgOutcomes;  // those of the wanted mappings first, in their order
+    RouterReply transport;   // not kOk: why the router could not be spoken to
     bool blStopped = false;
-    int nNextSeconds = 0;    // until something has to be done again; 0: nothing has to
-    bool blRenewed = false;  // every lease was asked for anew, due or not
+    int nNextSeconds = 0;  // until something has to be done again; 0: nothing has to
     RouterState enRouter = RouterState::kNotAsked;
 };
 
@@ -28,18 +26,18 @@ public:
 
     bool IsOver() {
         mResult.blStopped = mResult.blStopped || mFnStop();
-        if (mFnNow() > mNEnd && mResult.nTransport == kRouterOk) {
-            mResult.nTransport = kRouterTimeout;
+        if (mFnNow() > mNEnd && mResult.transport.IsOk()) {
+            mResult.transport = {Reply::kTimeout, "timeout"};
         }
-        return mResult.blStopped || mResult.nTransport != kRouterOk;
+        return mResult.blStopped || !mResult.transport.IsOk();
     }
     // Counts answers that did not come; after a few in a row the pass is over.
-    int Note(int nCode) {
-        mNSilent = nCode < 0 ? mNSilent + 1 : 0;
-        if (mNSilent >= kTransportTries || nCode == kRouterUnreachable) {
-            mResult.nTransport = nCode;
+    RouterReply Note(RouterReply reply) {
+        mNSilent = reply.IsSilence() ? mNSilent + 1 : 0;
+        if (mNSilent >= kTransportTries || reply.enReply == Reply::kUnreachable) {
+            mResult.transport = reply;
         }
-        return nCode;
+        return reply;
     }
 
 private:

@@ -1,16 +1,18 @@
 // See Plan.h.
 #include "mapping/Plan.h"
 
+#include "ground/Marks.h"
+
 namespace tavo {
 
 namespace {
 
-Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow) {
+Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow, bool blLeases) {
     switch (view.enSeen) {
         case Seen::kUnknown:
             return view.pMade == nullptr ? Step{} : Step{Action::kLook, "no rule asks for it, and it may be there"};
         case Seen::kHidden:
-            if (view.pMade != nullptr && view.pMade->IsSurelyOver(nNow)) {
+            if (view.pMade != nullptr && view.pMade->IsSurelyOver(nNow, blLeases)) {
                 return {Action::kForget, "its lease is over, and the place may be somebody else's"};
             }
             return view.pMade == nullptr ? Step{} : Step{Action::kRemove, "no rule asks for what we made here"};
@@ -53,9 +55,9 @@ bool Serves(const RouterMapping& entry, const RouterMapping& wanted, const std::
     return entry.szClient == szBox && entry.nBoxPort == wanted.nBoxPort && entry.blEnabled;
 }
 
-Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow) {
+Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, bool blLeases) {
     if (view.pWanted == nullptr) {
-        return Unwanted(view, szBox, nNow);
+        return Unwanted(view, szBox, nNow, blLeases);
     }
     switch (view.enSeen) {
         case Seen::kUnknown:

@@ -53,8 +53,9 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
                       {mapValues["client"], NumberIn<uint16_t>(mapValues["box_port"]), mapValues["text"],
                        mapValues["shown"] == "yes", NumberIn<uint32_t>(mapValues["lease"])}};
         const auto nAsked = NumberIn<int64_t>(mapValues["asked"]);
-        row.made.blBefore = !blThisBoot || mapValues["before"] == "yes" || nAsked < 0 || nAsked > kMostSeconds;
-        row.made.nAsked = row.made.blBefore ? 0 : nAsked;
+        const bool blCounts = blThisBoot && nAsked >= 0 && nAsked <= kMostSeconds;
+        row.made.blBefore = !blCounts || mapValues["before"] == "yes";
+        row.made.nAsked = blCounts ? nAsked : 0;
         row.made.nOtherPort = NumberIn<uint16_t>(mapValues["other_port"]);
         const bool blProtocol = row.key.first == "TCP" || row.key.first == "UDP";
         if (blProtocol && row.key.second != 0 && row.made.nBoxPort != 0) {
@@ -83,10 +84,23 @@ void Record::TurnTo(const RouterName& router) {
     mRgElsewhere = std::move(rgAll);
 }
 
-void Record::Prune(int64_t nNow) {
-    std::erase_if(mRgElsewhere, [nNow](const Elsewhere& row) { return row.made.IsSurelyOver(nNow); });
+void Record::Prune(int64_t nNow, bool blLeases) {
+    std::erase_if(mRgElsewhere, [&](const Elsewhere& row) { return row.made.IsSurelyOver(nNow, blLeases); });
     if (mRgElsewhere.size() > kMostElsewhere) {
         mRgElsewhere.erase(mRgElsewhere.begin(), mRgElsewhere.end() - kMostElsewhere);
+    }
+}
+
+void Record::Doubt() {
+    for (auto& [key, made] : mHere) {
+        made.blBefore = true;
+    }
+}
+
+void Record::Lose(const std::string& szBox) {
+    std::erase_if(mHere, [&](const auto& row) { return row.second.szClient != szBox; });
+    for (auto& [key, made] : mHere) {
+        made.blShown = false;
     }
 }
 

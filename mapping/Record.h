@@ -11,6 +11,7 @@
 #include <utility>
 #include <vector>
 
+#include "ground/Marks.h"
 #include "mapping/Router.h"
 
 namespace tavo {
@@ -41,7 +42,7 @@ struct Made {
     bool blShown = false;   // else it was asked for, or for a change of it, and may not be there
     uint32_t nLease = 0;    // seconds from nAsked; 0: until the router restarts
     int64_t nAsked = 0;     // seconds of boot time; of an earlier boot: 0
-    bool blBefore = false;  // asked for before this boot, so that nobody knows how long ago
+    bool blBefore = false;  // asked for before this boot, or doubtful for another reason: to be asked for anew
     // The other port that it may lead to: a change was asked for, and what came of it was not shown. 0: none.
     uint16_t nOtherPort = 0;
     std::string szHardware = {};  // of the router that it was made at, where the one in front does not show its own
@@ -59,8 +60,10 @@ struct Made {
     // Boot time at which the router has ended it by itself; -1: never, or nobody knows.
     int64_t End() const { return nLease == 0 ? -1 : nAsked + nLease; }
     // Whether its lease has surely ended. What a router has not shown may have been made without one: some refuse
-    // leases, and the answer may be lost.
-    bool IsSurelyOver(int64_t nNow) const { return blShown && End() >= 0 && nNow > End() + kSurely; }
+    // leases, and the answer may be lost. blLeases: not this one.
+    bool IsSurelyOver(int64_t nNow, bool blLeases = false) const {
+        return (blShown || blLeases) && End() >= 0 && nNow > End() + kSurely;
+    }
 
     static constexpr int64_t kSurely = 60;  // seconds after its end until a lease is believed to have ended
 };
@@ -77,7 +80,12 @@ public:
     const Rows& Here() const { return mHere; }
 
     // Drops the rows of other routers that have surely run out.
-    void Prune(int64_t nNow);
+    void Prune(int64_t nNow, bool blLeases = false);
+    // Nothing that this router once granted counts any more: all of it is due.
+    void Doubt();
+    // This router has lost all that it had: ours is to be made anew, and what led to an address that the box had before
+    // is gone.
+    void Lose(const std::string& szBox);
     std::string Text() const;
 
 private:

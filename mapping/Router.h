@@ -4,14 +4,10 @@
 
 #include <cstdint>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace tavo {
-
-// Every description that we give to a rule's mapping begins with this; it tells ours from everybody else's.
-inline constexpr char kOwnPrefix[] = "tavo:";
-// The same for the mappings that only test a router.
-inline constexpr char kTestPrefix[] = "tavotest:";
 
 struct RouterMapping {
     std::string szProtocol;  // "TCP" or "UDP"
@@ -23,35 +19,58 @@ struct RouterMapping {
     bool blEnabled = true;
 };
 
-// Answers of a router: 0, the protocol's own error code above 0, or why there was no answer below 0.
-enum RouterCode : int {
-    kRouterOk = 0,
-    kRouterTimeout = -1,
-    kRouterUnreachable = -2,
-    kRouterGarbage = -3,
-    kRouterTooLong = -4,  // a table that could not be read to its end in time
-    kRouterInvalidAction = 401,
-    kRouterInvalidArgs = 402,
-    kRouterNoSuchIndex = 713,
-    kRouterNoSuchEntry = 714,
-    kRouterConflict = 718,
-    kRouterOnlyPermanentLeases = 725
+// All that a router can say. What its protocol calls it is known to the adapter alone.
+enum class Reply {
+    kOk,
+    // No answer: nobody knows what came of the question.
+    kTimeout,
+    kUnreachable,
+    kGarbage,
+    kTooLong,  // a table that could not be read to its end in time
+    // Refusals.
+    kNoSuchEntry,
+    kConflict,
+    kOnlyPermanent,  // it takes no lease
+    kBadArguments,   // which some say instead
+    kElsewhere,      // it was made at another port of the router than the one that was asked for
+    kRefused
+};
+
+struct RouterReply {
+    Reply enReply = Reply::kOk;
+    std::string szWord = {};  // for the result file; empty with kOk
+
+    bool IsOk() const { return enReply == Reply::kOk; }
+    bool IsSilence() const { return enReply >= Reply::kTimeout && enReply <= Reply::kTooLong; }
+    bool IsRefusal() const { return enReply > Reply::kTooLong; }
+};
+
+// What a router can do.
+struct Abilities {
+    bool blShows = true;       // its table can be read; else what it has granted is what there is to know
+    bool blLeases = false;     // every mapping ends by itself, whatever becomes of the answer
+    bool blByBoxPort = false;  // it knows a mapping by its client and the client\'s port, and has one for each
+    std::string szConflict = "conflict";  // its word for kConflict
 };
 
 class Router {
 public:
     virtual ~Router() = default;
-    // Outputs are set only with kRouterOk; with kRouterTooLong, List() has what was read.
-    virtual int List(std::vector<RouterMapping>& rgMappings) = 0;
+    virtual Abilities What() const { return {}; }
+    // Outputs are set only with kOk; with kTooLong, List() has what was read. Of a router that shows nothing: whether
+    // it is there.
+    virtual RouterReply List(std::vector<RouterMapping>& rgMappings) = 0;
     // The box's own mappings between two ports, where the router can show them at once. May leave some
     // out: what it shows is there, what it does not show may be there too.
-    virtual int ListRange(const std::string& /*szProtocol*/, uint16_t /*nFirst*/, uint16_t /*nLast*/,
-                          std::vector<RouterMapping>& /*rgMappings*/) {
-        return kRouterInvalidAction;
+    virtual RouterReply ListRange(const std::string& /*szProtocol*/, uint16_t /*nFirst*/, uint16_t /*nLast*/,
+                                  std::vector<RouterMapping>& /*rgMappings*/) {
+        return {Reply::kRefused};
     }
-    virtual int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) = 0;
-    virtual int Add(const RouterMapping& mapping) = 0;
-    virtual int Remove(const std::string& szProtocol, uint16_t nRouterPort) = 0;
+    virtual RouterReply Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) = 0;
+    // mapping becomes what was made, as far as the router says: its lease, and with kElsewhere its port.
+    virtual RouterReply Add(RouterMapping& mapping) = 0;
+    // What is known of the mapping: protocols differ in what they call it by.
+    virtual RouterReply Remove(const RouterMapping& mapping) = 0;
 };
 
 }  // namespace tavo

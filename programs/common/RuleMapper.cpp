@@ -50,8 +50,7 @@ std::string NetworkInSight() {
 
 }  // namespace
 
-RuleMapper::RuleMapper(const DaemonNames& names, bool blRequestRenews)
-    : mNames(names), mBlRequestRenews(blRequestRenews), mTold(names.szName) {
+RuleMapper::RuleMapper(const DaemonNames& names) : mNames(names), mTold(names.szName) {
     ReadSettings();
 }
 
@@ -92,7 +91,6 @@ bool RuleMapper::FindGateway() {
     if (mSzGateway != szGateway || mSzBox != szBox) {
         mSzGateway = szGateway;
         mSzBox = szBox;
-        mNLease = 0;
         mNUntilOutside = 0;
         mSzOutside.clear();
         if (blFound) {
@@ -115,13 +113,23 @@ bool RuleMapper::OnNetworkChange() {
     return std::exchange(mSzNetwork, szNow) != szNow;
 }
 
+Surroundings RuleMapper::Around(const std::function<bool()>& fnStop, MadeFile& made) const {
+    return {mSzBox, BootSeconds, fnStop, [&made] { made.Save(); },
+            [](const RouterMapping& mapping, const Step& step) {
+                const bool blOpened = step.enAction == Action::kAdd;
+                SysLog(LOG_INFO, "%s %s %s:%u: %s", MappingName(mapping).c_str(),
+                       blOpened ? "is to lead to" : "no longer leads to", mapping.szClient.c_str(),
+                       static_cast<unsigned>(mapping.nBoxPort), step.szWhy);
+            }};
+}
+
 PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter) {
     const PortState enState = enRouter == RouterState::kBusy ? PortState::kWaiting : PortState::kUnknown;
     PassResult result;
     for (const RouterMapping& wanted : rgWanted) {
         result.rgOutcomes.push_back(OutcomeOf(wanted, {enState, szWord}));
     }
-    result.nTransport = kRouterUnreachable;
+    result.transport = {Reply::kUnreachable, szWord};
     result.enRouter = enRouter;
     return result;
 }
@@ -131,7 +139,7 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
         const bool blSwitchedOn = IsSwitchedOn();
         PassResult result =
             Failed(mWanted.rgMappings, "busy", blSwitchedOn ? RouterState::kBusy : RouterState::kNotAsked);
-        result.nTransport = blSwitchedOn ? kRouterTimeout : kRouterOk;
+        result.transport = {blSwitchedOn ? Reply::kTimeout : Reply::kOk};
         result.blStopped = fnStop();
         return result;
     }
@@ -141,15 +149,7 @@ PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnSto
     if (!FindGateway()) {
         return Failed(mWanted.rgMappings, "nogateway", RouterState::kNoGateway);
     }
-    const auto now = BootClock::now();
-    const bool blDue = mNLease != 0 && now - mRenewed >= std::chrono::seconds(mNLease / 2);
-    const bool blRenew = blDue || (blRequested && mBlRequestRenews);
-    PassResult result = Map(mWanted.rgMappings, blRenew, fnStop);
-    if (result.nTransport == kRouterOk && !result.blStopped) {
-        mRenewed = blRenew || result.blRenewed || mNLease == 0 ? now : mRenewed;
-        mNLease = result.nShortestLease;
-    }
-    return result;
+    return Map(mWanted.rgMappings, blRequested, fnStop);
 }
 
 int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
@@ -175,10 +175,9 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
 }
 
 int RuleMapper::SecondsToNext(const PassResult& result) {
-    if (result.nTransport != kRouterOk) {
+    if (!result.transport.IsOk()) {
         if (++mNFailures >= kFailuresToRediscover) {
             mNFailures = 0;
-            mNLease = 0;
             LostRouter();
         }
         return std::min(mNCheckSeconds, kRetrySeconds);
@@ -187,15 +186,7 @@ int RuleMapper::SecondsToNext(const PassResult& result) {
     if (!mBlMended) {
         return std::min(mNCheckSeconds, kRetrySeconds);
     }
-    if (result.nNextSeconds > 0) {
-        return std::min(mNCheckSeconds, result.nNextSeconds);
-    }
-    if (mNLease == 0) {
-        return mNCheckSeconds;
-    }
-    const auto left = mRenewed + std::chrono::seconds(mNLease / 2) - BootClock::now();
-    const auto nLeft = std::chrono::ceil<std::chrono::seconds>(left).count();
-    return static_cast<int>(std::clamp<int64_t>(nLeft, 1, mNCheckSeconds));
+    return result.nNextSeconds > 0 ? std::min(mNCheckSeconds, result.nNextSeconds) : mNCheckSeconds;
 }
 
 // What the rules themselves say of the outcomes: whose they are, and what was not asked of the router at all.
@@ -285,7 +276,7 @@ bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
     }
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = Map({}, false, fnStop);
-        if (result.nTransport == kRouterOk && result.rgOutcomes.empty()) {
+        if (result.transport.IsOk() && result.rgOutcomes.empty()) {
             mTold.Get().blWithdrawn = true;
             mTold.Save();
             return true;

@@ -12,8 +12,10 @@
 #include <vector>
 
 #include "ground/BootClock.h"
+#include "mapping/Carry.h"
 #include "mapping/Pass.h"
 #include "programs/common/Daemon.h"
+#include "programs/common/MadeFile.h"
 #include "programs/common/Published.h"
 #include "programs/common/RouterTurn.h"
 #include "programs/common/Teller.h"
@@ -35,12 +37,10 @@ public:
     bool OnWake() override { return mAnnouncements.TakeNews(mSzGateway); }
 
 protected:
-    // blRequestRenews: a request has every mapping asked for again, because the router cannot be asked
-    // what it has.
-    RuleMapper(const DaemonNames& names, bool blRequestRenews);
+    explicit RuleMapper(const DaemonNames& names);
 
-    // Brings the router in line. blRenew: leases are due.
-    virtual PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+    // Brings the router in line. blRequested: somebody asked for it, and the clock did not.
+    virtual PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                            const std::function<bool()>& fnStop) = 0;
     // The result file's text, of names and words of all that was asked for; "1" is success.
     virtual std::string ResultText(const OutcomeList& rgOutcomes) const = 0;
@@ -57,6 +57,8 @@ protected:
     const std::string& Gateway() const { return mSzGateway; }
     const std::string& Box() const { return mSzBox; }
     uint32_t WishedLease() const { return mNWishedLease; }
+    // What the core needs to know of this box; what it does is logged.
+    Surroundings Around(const std::function<bool()>& fnStop, MadeFile& made) const;
 
 private:
     bool MendRunKeys();
@@ -74,7 +76,6 @@ private:
     void TellNews(const Published& state, bool blRequested);
 
     const DaemonNames& mNames;
-    bool mBlRequestRenews;
     int mNCheckSeconds = 0;
     uint32_t mNWishedLease = 0;
     WantedSet mWanted;
@@ -86,8 +87,6 @@ private:
     std::string mSzGateway;
     std::string mSzBox;
     int mNFailures = 0;
-    uint32_t mNLease = 0;  // seconds that the router grants
-    BootClock::time_point mRenewed;
     std::string mSzOutside;
     int mNUntilOutside = 0;  // passes until the router is asked for it again
     ToldFile mTold;

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "ground/ConfList.h"
+#include "ground/Marks.h"
 #include "ground/PortText.h"
 #include "ground/TextFile.h"
 

@@ -1,4 +1,4 @@
-// Keeps the gateway's NAT-PMP mappings in line with the rules. Relies on NatpmpPass.
+// Keeps the gateway's NAT-PMP mappings in line with the rules. Relies on the mapping core.
 // Promises: see NatpmpMapper.h.
 #include "programs/natpmpd/NatpmpMapper.h"
 
@@ -12,6 +12,8 @@
 #include <utility>
 
 #include "ground/SysLog.h"
+#include "ground/net/Neighbour.h"
+#include "programs/natpmpd/NatpmpRouter.h"
 
 namespace tavo {
 
@@ -32,6 +34,24 @@ constexpr int kAnnouncementsAtOnce = 64;              // of a flood, no more tha
 constexpr std::pair<std::string_view, const char*> kCommonWords[] = {
     {"nogateway", "no gateway"}, {"busy", "upnpd has not taken its mappings away yet"}};
 
+// A gateway keeps one mapping for each port of the box and ends it by that port. Asking for a second one
+// would be answered with the first, and giving that back would end it.
+constexpr char kShared[] = "another rule has this port of the box; NAT-PMP gives it one router port only";
+constexpr size_t kMostRouters = 16;  // whose clocks are kept
+constexpr int kYoungAgain = 10;      // seconds until a gateway that has just started is asked once more
+constexpr char kMadeFile[] = "/var/lib/tavo/natpmp_made.conf";
+
+RouterState StateOf(Reply enReply) {
+    switch (enReply) {
+        case Reply::kOk:
+            return RouterState::kOk;
+        case Reply::kUnreachable:
+            return RouterState::kNoService;
+        default:
+            return RouterState::kSilent;
+    }
+}
+
 // Hosts are members of their all-hosts group without asking.
 Descriptor ListenForAnnouncements() {
     Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
@@ -50,21 +70,19 @@ Descriptor ListenForAnnouncements() {
 
 }  // namespace
 
-NatpmpMapper::NatpmpMapper() : RuleMapper(kNames, true), mFdAnnouncements(ListenForAnnouncements()) {}
+NatpmpMapper::NatpmpMapper() : RuleMapper(kNames), mFdAnnouncements(ListenForAnnouncements()), mMade(kMadeFile) {}
 
+// What was made here before is as doubtful as what was read from the file.
 void NatpmpMapper::NewGateway() {
-    mState.epoch = EpochWatch();
-    mState.mapRemapped.clear();
-    mState.szOutside.clear();
-    // What was held here before is as doubtful as what was read from the file.
-    for (auto& [key, held] : mState.held.mRows) {
-        held.nLifetime = 0;
-    }
+    mPEpoch = nullptr;
+    mHabit.mapElsewhere.clear();
+    mSzOutside.clear();
+    mBlDoubtful = true;
 }
 
 bool NatpmpMapper::OnWake() {
     bool blRestart = RuleMapper::OnWake();
-    mState.blDoubtful = mState.blDoubtful || blRestart;  // its clock may not show it
+    mBlDoubtful = mBlDoubtful || blRestart;  // its clock may not show it
     uint8_t rgBytes[kAnnouncementSize];
     sockaddr_in sender = {};
     socklen_t nLength = sizeof(sender);
@@ -78,15 +96,75 @@ bool NatpmpMapper::OnWake() {
             std::memcmp(rgBytes, kAddressAnswer, sizeof(kAddressAnswer)) == 0) {
             uint32_t nEpoch = 0;
             std::memcpy(&nEpoch, rgBytes + sizeof(kAddressAnswer), sizeof(nEpoch));
-            blRestart = blRestart || mState.epoch.IsRestart(ntohl(nEpoch), BootClock::now());
+            blRestart = blRestart || (mPEpoch != nullptr && mPEpoch->IsRestart(ntohl(nEpoch), BootClock::now()));
         }
     }
     return blRestart;
 }
 
-PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+// What no longer counts of what the gateway granted. A request has every mapping asked for again, because the gateway
+// cannot be asked what it has.
+void NatpmpMapper::Forget(bool blRequested) {
+    const auto now = BootClock::now();
+    const bool blDoubtful = blRequested || mBlDoubtful;
+    if (mPEpoch->TakeRestart()) {
+        SysLog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
+        mMade.Get().Lose(Box());
+    } else if (blDoubtful) {
+        mMade.Get().Doubt();
+    }
+    if (blDoubtful || now - mAskedElsewhere > std::chrono::seconds(WishedLease() / 2)) {
+        mHabit.mapElsewhere.clear();
+        mAskedElsewhere = now;
+    }
+}
+
+PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                              const std::function<bool()>& fnStop) {
-    return NatpmpPass(mState, Gateway(), Box(), WishedLease(), fnStop).Run(rgWanted, blRenew);
+    Record& record = mMade.Get();
+    const RouterName name{Gateway(), HardwareAddress(Gateway())};
+    record.TurnTo(name);
+    if (mMapEpochs.size() >= kMostRouters) {
+        mMapEpochs.clear();
+    }
+    mPEpoch = &mMapEpochs[name.szHardware.empty() ? name.szGateway : name.szHardware];
+    record.Prune(BootSeconds(), true);
+    if (rgWanted.empty() && record.Here().empty()) {
+        mMade.Save();
+        return {};
+    }
+    std::vector<RouterMapping> rgAsked;
+    std::map<std::pair<std::string, uint16_t>, size_t> mapBoxPorts;
+    for (const RouterMapping& wanted : rgWanted) {  // the first rule that asks for a port of the box has it
+        if (mapBoxPorts.emplace(std::pair(wanted.szProtocol, wanted.nBoxPort), rgAsked.size()).second) {
+            rgAsked.push_back(wanted);
+        }
+    }
+    NatpmpRouter router(Gateway(), Box(), *mPEpoch, fnStop);
+    router.AskAddress(mSzOutside);
+    Forget(blRequested);
+    mHabit.nLease = WishedLease();
+    const auto fnPass = [&] { return BringInLine(router, rgAsked, record, mHabit, Around(fnStop, mMade)); };
+    PassResult result = fnPass();
+    if (mPEpoch->TakeRestart()) {  // it restarted while we spoke
+        record.Lose(Box());
+        result = fnPass();
+    }
+    for (size_t i = 0, nAsked = 0; i < rgWanted.size(); ++i) {
+        if (nAsked < rgAsked.size() && KeyOf(rgAsked[nAsked]) == KeyOf(rgWanted[i])) {
+            ++nAsked;
+        } else {
+            result.rgOutcomes.insert(result.rgOutcomes.begin() + static_cast<std::ptrdiff_t>(i),
+                                     OutcomeOf(rgWanted[i], {PortState::kRefused, kShared}));
+        }
+    }
+    const bool blYoung = result.transport.IsOk() && mPEpoch->IsYoung();
+    mBlDoubtful = !result.transport.IsOk() || blYoung;
+    if (blYoung && !rgAsked.empty()) {
+        result.nNextSeconds = kYoungAgain;
+    }
+    result.enRouter = StateOf(result.transport.enReply);
+    return result;
 }
 
 // What is wrong, for a user: whatever stands here makes a save fail, so nothing does when all is well.
@@ -97,7 +175,8 @@ std::string NatpmpMapper::ResultText(const OutcomeList& rgOutcomes) const {
         if (szWord == "1") {
             continue;
         }
-        std::string szShown = szWord;
+        const bool blOpen = outcome.blLeftOver && outcome.verdict.enState != PortState::kWaiting;
+        std::string szShown = (blOpen ? "still open: " : "") + szWord;
         for (const auto& [szCommon, szHere] : kCommonWords) {
             szShown = szWord == szCommon ? szHere : szShown;
         }
@@ -108,7 +187,7 @@ std::string NatpmpMapper::ResultText(const OutcomeList& rgOutcomes) const {
 
 // Each pass has asked for it already.
 std::string NatpmpMapper::Outside(const std::function<bool()>& /*fnStop*/) {
-    return mState.szOutside;
+    return mSzOutside;
 }
 
 }  // namespace tavo

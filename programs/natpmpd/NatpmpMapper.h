@@ -1,13 +1,16 @@
 // The mapping side of natpmpd: the gateway's NAT-PMP mappings kept in line with the rules.
-// Relies on NatpmpPass and on the gateway's announcements. Promises: see RuleMapper.h; a gateway that
+// Relies on the mapping core and on the gateway's announcements. Promises: see RuleMapper.h; a gateway that
 // restarts gets every mapping again, at once when it announces its return.
 #pragma once
 
+#include <map>
 #include <string>
 
 #include "ground/Descriptor.h"
+#include "mapping/Carry.h"
+#include "programs/common/MadeFile.h"
 #include "programs/common/RuleMapper.h"
-#include "programs/natpmpd/NatpmpPass.h"
+#include "programs/natpmpd/EpochWatch.h"
 
 namespace tavo {
 
@@ -22,14 +25,22 @@ public:
     bool OnWake() override;
 
 private:
-    PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+    PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                    const std::function<bool()>& fnStop) override;
     std::string ResultText(const OutcomeList& rgOutcomes) const override;
     std::string Outside(const std::function<bool()>& fnStop) override;
     void NewGateway() override;
 
+    void Forget(bool blRequested);
+
     Descriptor mFdAnnouncements;
-    NatpmpState mState;
+    MadeFile mMade;
+    Habits mHabit;
+    BootClock::time_point mAskedElsewhere;         // since then, mHabit.mapElsewhere has grown
+    std::map<std::string, EpochWatch> mMapEpochs;  // by what names a router
+    EpochWatch* mPEpoch = nullptr;                 // of the one in front; null before the first pass there
+    bool mBlDoubtful = false;  // the gateway did not answer the last time, or had just started: it may have begun anew
+    std::string mSzOutside;    // its address on its other side, as it said the last time
 };
 
 }  // namespace tavo

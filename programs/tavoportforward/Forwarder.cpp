@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <charconv>
 
+#include "ground/Marks.h"
 #include "ground/TextFile.h"
 #include "programs/common/Wanted.h"
 

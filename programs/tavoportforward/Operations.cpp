@@ -11,6 +11,7 @@
 #include <string_view>
 
 #include "ground/ConfList.h"
+#include "ground/Marks.h"
 #include "ground/TextFile.h"
 #include "programs/common/Wanted.h"
 

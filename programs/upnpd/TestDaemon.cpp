@@ -99,10 +99,11 @@ bool TestDaemon::FindRouter() {
         }
         return false;
     }
+    mPRouter = std::make_unique<IgdRouter>(*mPIgd);
     for (const RouterMapping& wanted : ReadWanted(kRunKey).rgMappings) {
         mSetRulePorts.insert({wanted.nRouterPort, wanted.nBoxPort});
     }
-    mPMappings = std::make_unique<TestMappings>(*mPIgd, szBox, LoadTestRules(),
+    mPMappings = std::make_unique<TestMappings>(*mPRouter, szBox, LoadTestRules(),
                                                 [this](uint16_t nPort) { return HoldPort(nPort); });
     return true;
 }

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "ground/Descriptor.h"
+#include "programs/common/IgdRouter.h"
 #include "programs/common/SignalQueue.h"
 #include "programs/upnpd/TestMappings.h"
 #include "wire/upnp/Igd.h"
@@ -52,6 +53,7 @@ private:
     std::set<uint16_t> mSetRulePorts;  // what the rules ask for is not for tests
     std::vector<Descriptor> mRgFdPorts;
     std::unique_ptr<Igd> mPIgd;
+    std::unique_ptr<IgdRouter> mPRouter;
     std::unique_ptr<TestMappings> mPMappings;
 };
 

@@ -3,6 +3,9 @@
 
 #include <algorithm>
 
+#include "ground/Marks.h"
+#include "mapping/Plan.h"
+
 namespace tavo {
 
 namespace {
@@ -32,28 +35,28 @@ struct TestMappings::Step {
     int nConflicts = 0;
 };
 
-// What the router's table holds of ours, and which ports are taken. The router's code, or why it gave none.
-int TestMappings::ReadTable(std::vector<RouterMapping>& rgOwn) {
+// What the router's table holds of ours, and which ports are taken.
+RouterReply TestMappings::ReadTable(std::vector<RouterMapping>& rgOwn) {
     std::vector<RouterMapping> rgTable;
-    const int nCode = mRouter.List(rgTable);
-    mBlTableRead = nCode == kRouterOk;
+    RouterReply reply = mRouter.List(rgTable);
+    mBlTableRead = reply.IsOk();
     mSetHeld.clear();
     for (const RouterMapping& entry : rgTable) {
         if (entry.szProtocol == kProtocol) {
             mSetHeld.insert(entry.nRouterPort);
         }
-        if (IsTestMapping(entry, mSzBox)) {
+        if (IsTestMapping(entry)) {
             rgOwn.push_back(entry);
         }
     }
-    return nCode;
+    return reply;
 }
 
 bool TestMappings::CleanUp(const Stop& fnStop) {
     Step step(fnStop);
     std::vector<RouterMapping> rgOwn;
-    if (const int nCode = ReadTable(rgOwn); nCode != kRouterOk && nCode != kRouterTooLong) {
-        return nCode > 0;  // a router that cannot show its table has nothing that we could know of
+    if (const RouterReply reply = ReadTable(rgOwn); !reply.IsOk() && reply.enReply != Reply::kTooLong) {
+        return reply.IsRefusal();  // a router that cannot show its table has nothing that we could know of
     }
     if (rgOwn.empty()) {
         return true;
@@ -62,14 +65,23 @@ bool TestMappings::CleanUp(const Stop& fnStop) {
         if (step.guard.IsOver()) {
             return false;
         }
-        step.guard.Note(mRouter.Remove(entry.szProtocol, entry.nRouterPort));
+        step.guard.Note(mRouter.Remove(entry));
     }
     rgOwn.clear();
     if (step.guard.IsOver()) {
         return false;
     }
-    const int nCode = ReadTable(rgOwn);
-    return (nCode >= 0 || nCode == kRouterTooLong) && rgOwn.empty();
+    const RouterReply reply = ReadTable(rgOwn);
+    return (!reply.IsSilence() || reply.enReply == Reply::kTooLong) && rgOwn.empty();
+}
+
+bool TestMappings::IsTestMapping(const RouterMapping& entry) const {
+    return entry.szClient == mSzBox && entry.szDescription.starts_with(kTestPrefix);
+}
+
+RouterMapping TestMappings::MappingOf(const TestRule& rule) const {
+    return {kProtocol, rule.nRouterPort, rule.nBoxPort, mSzBox, kTestPrefix + std::to_string(rule.nRouterPort), 0,
+            true};
 }
 
 // The next port that nobody has, here or at the router.
@@ -85,37 +97,39 @@ bool TestMappings::Choose(TestRule& rule) {
     return false;
 }
 
-int TestMappings::Ask(const TestRule& rule) {
-    RouterMapping mapping{
-        kProtocol, rule.nRouterPort, rule.nBoxPort, mSzBox, kTestPrefix + std::to_string(rule.nRouterPort), 0, true};
+RouterReply TestMappings::Ask(const TestRule& rule) {
+    RouterMapping mapping = MappingOf(rule);
     return AddWithLease(mRouter, mapping, mHabit);
 }
 
 // Asks for a rule's mapping, on another port where somebody else has this one.
-int TestMappings::AskSomewhere(Step& step, TestRule& rule) {
-    int nCode = kRouterConflict;
-    while (nCode == kRouterConflict && step.nConflicts < kMostConflicts && !step.guard.IsOver()) {
+RouterReply TestMappings::AskSomewhere(Step& step, TestRule& rule) {
+    RouterReply reply{Reply::kConflict};
+    while (reply.enReply == Reply::kConflict && step.nConflicts < kMostConflicts && !step.guard.IsOver()) {
         if (!Choose(rule)) {
             rule.szResult = kNoPort;
-            return kRouterConflict;
+            return reply;
         }
         RouterMapping entry;
-        if (!mBlTableRead && step.guard.Note(mRouter.Get(kProtocol, rule.nRouterPort, entry)) <= kRouterOk) {
+        if (!mBlTableRead && !step.guard.Note(mRouter.Get(kProtocol, rule.nRouterPort, entry)).IsRefusal()) {
             ++step.nConflicts;
             rule.szResult = kUntried;  // somebody has it, or nobody knows
             continue;
         }
-        nCode = step.guard.Note(Ask(rule));
-        step.nConflicts += nCode == kRouterConflict ? 1 : 0;
-        rule.szResult = nCode == kRouterOk ? kMade : CodeText(nCode);
+        reply = step.guard.Note(Ask(rule));
+        step.nConflicts += reply.enReply == Reply::kConflict ? 1 : 0;
+        rule.szResult = reply.IsOk() ? kMade : reply.szWord;
     }
-    return nCode;
+    return reply;
 }
 
 // False when the router does not say.
 bool TestMappings::IsShown(Step& step, const TestRule& rule, bool& blShown) {
     while (!step.guard.IsOver()) {
-        if (step.guard.Note(ShowsRule(mRouter, rule, mSzBox, blShown)) >= kRouterOk) {
+        RouterMapping entry;
+        const RouterReply reply = step.guard.Note(mRouter.Get(kProtocol, rule.nRouterPort, entry));
+        if (!reply.IsSilence()) {  // whatever it refuses an entry with, it does not show one
+            blShown = reply.IsOk() && Serves(entry, MappingOf(rule), mSzBox);
             return true;
         }
     }
@@ -147,7 +161,7 @@ bool TestMappings::Add(const Stop& fnStop) {
             rule.szResult = kUntried;
             continue;
         }
-        step.nRefused = AskSomewhere(step, rule) > kRouterOk ? step.nRefused + 1 : 0;
+        step.nRefused = AskSomewhere(step, rule).IsRefusal() ? step.nRefused + 1 : 0;
         if (IsTried(rule)) {
             rgpTried.push_back(&rule);
         }
@@ -172,8 +186,8 @@ bool TestMappings::Readd(const Stop& fnStop) {
         if (step.guard.IsOver()) {
             return false;
         }
-        const int nCode = step.guard.Note(Ask(*pRule));
-        pRule->szResult = nCode == kRouterOk ? kMade : CodeText(nCode);
+        const RouterReply reply = step.guard.Note(Ask(*pRule));
+        pRule->szResult = reply.IsOk() ? kMade : reply.szWord;
     }
     return ReadBack(step, rgpKept) && Kept().size() == rgpKept.size();
 }
@@ -198,8 +212,8 @@ bool TestMappings::Change(const Stop& fnStop) {
     }
     for (size_t i = 0; i < rgpChanged.size() && !step.guard.IsOver(); ++i) {
         rgpChanged[i]->nBoxPort = rgPorts[i];
-        const int nCode = step.guard.Note(Ask(*rgpChanged[i]));
-        rgpChanged[i]->szResult = nCode == kRouterOk ? kMade : CodeText(nCode);
+        const RouterReply reply = step.guard.Note(Ask(*rgpChanged[i]));
+        rgpChanged[i]->szResult = reply.IsOk() ? kMade : reply.szWord;
     }
     return ReadBack(step, rgpChanged) &&
            std::all_of(rgpChanged.begin(), rgpChanged.end(), [](const TestRule* pRule) { return pRule->blKept; });
@@ -209,16 +223,15 @@ bool TestMappings::Change(const Stop& fnStop) {
 bool TestMappings::RemoveRule(Step& step, const TestRule& rule) {
     while (!step.guard.IsOver()) {
         RouterMapping entry;
-        int nCode = step.guard.Note(mRouter.Get(kProtocol, rule.nRouterPort, entry));
-        if (nCode > kRouterOk) {
+        RouterReply reply = step.guard.Note(mRouter.Get(kProtocol, rule.nRouterPort, entry));
+        if (reply.IsRefusal()) {
             return true;
         }
-        const bool blOurs =
-            entry.szClient == mSzBox && (entry.nBoxPort == rule.nBoxPort || IsTestMapping(entry, mSzBox));
-        if (nCode == kRouterOk && blOurs) {
-            nCode = step.guard.Note(mRouter.Remove(kProtocol, rule.nRouterPort));
+        const bool blOurs = entry.szClient == mSzBox && (entry.nBoxPort == rule.nBoxPort || IsTestMapping(entry));
+        if (reply.IsOk() && blOurs) {
+            reply = step.guard.Note(mRouter.Remove(entry));
         }
-        if (nCode >= kRouterOk) {
+        if (!reply.IsSilence()) {
             return true;
         }
     }

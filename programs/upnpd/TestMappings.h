@@ -38,10 +38,12 @@ public:
 
 private:
     struct Step;
-    int ReadTable(std::vector<RouterMapping>& rgOwn);
+    RouterReply ReadTable(std::vector<RouterMapping>& rgOwn);
+    bool IsTestMapping(const RouterMapping& entry) const;
+    RouterMapping MappingOf(const TestRule& rule) const;
     bool Choose(TestRule& rule);
-    int Ask(const TestRule& rule);
-    int AskSomewhere(Step& step, TestRule& rule);
+    RouterReply Ask(const TestRule& rule);
+    RouterReply AskSomewhere(Step& step, TestRule& rule);
     bool IsShown(Step& step, const TestRule& rule, bool& blShown);
     bool ReadBack(Step& step, const std::vector<TestRule*>& rgpRules);
     bool RemoveRule(Step& step, const TestRule& rule);
@@ -51,7 +53,7 @@ private:
     std::string mSzBox;
     std::vector<TestRule> mRgRules;
     std::function<bool(uint16_t)> mFnHold;
-    LeaseHabit mHabit;
+    Habits mHabit;
     std::set<uint16_t> mSetHeld;  // TCP ports of the router that are somebody's
     bool mBlTableRead = false;    // else each port is asked for
     int mNNext = 0;               // the next port to try; 0: the first rule's

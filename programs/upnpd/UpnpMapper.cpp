@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "ground/net/Neighbour.h"
+#include "programs/common/IgdRouter.h"
 #include "wire/upnp/GatewayMemory.h"
 
 namespace tavo {
@@ -21,7 +22,7 @@ constexpr int kOutsideMilliseconds = 2000;
 
 }  // namespace
 
-UpnpMapper::UpnpMapper() : RuleMapper(kNames, false), mMade(kMadeFile) {}
+UpnpMapper::UpnpMapper() : RuleMapper(kNames), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();
@@ -84,9 +85,9 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     const bool blPermanentOnly = mHabit.blPermanentOnly;
-    PassResult result =
-        BringInLine(*mPIgd, rgWanted, mMade.Get(), mHabit, {Box(), BootSeconds, fnStop, [this] { mMade.Save(); }});
-    result.enRouter = result.nTransport == kRouterOk ? RouterState::kOk : RouterState::kSilent;
+    IgdRouter router(*mPIgd);
+    PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, Around(fnStop, mMade));
+    result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;
     if (blPermanentOnly != mHabit.blPermanentOnly) {
         Remember();
     }
@@ -94,11 +95,11 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
 }
 
 // The record knows what is due.
-PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool /*blRenew*/,
+PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool /*blRequested*/,
                            const std::function<bool()>& fnStop) {
-    const PassResult result = MapOnce(rgWanted, fnStop);
+    PassResult result = MapOnce(rgWanted, fnStop);
     // A router that restarted often has its service at another port: look for it at once.
-    if (result.nTransport == kRouterUnreachable && mPIgd != nullptr && !result.blStopped) {
+    if (result.transport.enReply == Reply::kUnreachable && mPIgd != nullptr && !result.blStopped) {
         LostRouter();
         return MapOnce(rgWanted, fnStop);
     }

@@ -17,7 +17,7 @@ public:
     UpnpMapper();
 
 private:
-    PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRenew,
+    PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                    const std::function<bool()>& fnStop) override;
     std::string ResultText(const OutcomeList& rgOutcomes) const override;
     std::string Outside(const std::function<bool()>& fnStop) override;
@@ -31,7 +31,7 @@ private:
 
     std::string mSzLocation;
     std::unique_ptr<Igd> mPIgd;
-    LeaseHabit mHabit;
+    Habits mHabit;
     MadeFile mMade;
 };
 

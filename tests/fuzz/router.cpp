@@ -13,7 +13,9 @@
 #include <string_view>
 #include <tuple>
 
+#include "ground/Marks.h"
 #include "mapping/Carry.h"
+#include "programs/common/IgdRouter.h"
 #include "programs/common/Wanted.h"
 #include "wire/upnp/Igd.h"
 #include "wire/upnp/Search.h"
@@ -104,40 +106,41 @@ class Watched : public tavo::Router {
 public:
     explicit Watched(tavo::Igd& igd) : mIgd(igd) {}
 
-    int List(std::vector<tavo::RouterMapping>& rgMappings) override {
-        const int nCode = mIgd.List(rgMappings);
-        gReach.nListed += nCode == tavo::kRouterOk ? 1 : 0;
-        return Take(rgMappings, nCode);
+    tavo::Abilities What() const override { return mIgd.What(); }
+    tavo::RouterReply List(std::vector<tavo::RouterMapping>& rgMappings) override {
+        tavo::RouterReply reply = mIgd.List(rgMappings);
+        gReach.nListed += reply.IsOk() ? 1 : 0;
+        return Take(rgMappings, std::move(reply));
     }
-    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                  std::vector<tavo::RouterMapping>& rgMappings) override {
+    tavo::RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                                std::vector<tavo::RouterMapping>& rgMappings) override {
         return Take(rgMappings, mIgd.ListRange(szProtocol, nFirst, nLast, rgMappings));
     }
-    int Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override {
+    tavo::RouterReply Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override {
         std::vector<tavo::RouterMapping> rgMappings(1);
-        const int nCode = Take(rgMappings, mIgd.Get(szProtocol, nRouterPort, rgMappings[0]));
+        tavo::RouterReply reply = Take(rgMappings, mIgd.Get(szProtocol, nRouterPort, rgMappings[0]));
         mapping = rgMappings[0];
-        return nCode;
+        return reply;
     }
-    int Add(const tavo::RouterMapping& mapping) override {
-        const int nCode = mIgd.Add(mapping);
-        gReach.nAdded += nCode == tavo::kRouterOk ? 1 : 0;
-        return nCode;
+    tavo::RouterReply Add(tavo::RouterMapping& mapping) override {
+        tavo::RouterReply reply = mIgd.Add(mapping);
+        gReach.nAdded += reply.IsOk() ? 1 : 0;
+        return reply;
     }
-    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override {
-        Require(mSetOwn.contains({szProtocol, nRouterPort}), "only what the router showed as ours is taken away");
-        const int nCode = mIgd.Remove(szProtocol, nRouterPort);
-        gReach.nRemoved += nCode == tavo::kRouterOk ? 1 : 0;
-        return nCode;
+    tavo::RouterReply Remove(const tavo::RouterMapping& mapping) override {
+        Require(mSetOwn.contains(tavo::KeyOf(mapping)), "only what the router showed as ours is taken away");
+        tavo::RouterReply reply = mIgd.Remove(mapping);
+        gReach.nRemoved += reply.IsOk() ? 1 : 0;
+        return reply;
     }
     bool HasShown(const tavo::RouterMapping& wanted) const {
         return mSetServed.contains({wanted.szProtocol, wanted.nRouterPort, wanted.nBoxPort});
     }
 
 private:
-    int Take(const std::vector<tavo::RouterMapping>& rgMappings, int nCode) {
+    tavo::RouterReply Take(const std::vector<tavo::RouterMapping>& rgMappings, tavo::RouterReply reply) {
         for (const tavo::RouterMapping& mapping : rgMappings) {
-            if (nCode == tavo::kRouterOk) {
+            if (reply.IsOk()) {
                 Require(mapping.szProtocol == "TCP" || mapping.szProtocol == "UDP", "entries make sense");
                 RequirePrintable(mapping.szDescription);
                 RequirePrintable(mapping.szClient);
@@ -149,10 +152,10 @@ private:
                 }
             }
         }
-        return nCode;
+        return reply;
     }
 
-    tavo::Igd& mIgd;
+    tavo::IgdRouter mIgd;
     std::set<std::pair<std::string, uint16_t>> mSetOwn;
     std::set<std::tuple<std::string, uint16_t, uint16_t>> mSetServed;
 };
@@ -163,7 +166,7 @@ void Map(tavo::Igd& igd) {
         rgWanted.push_back({i % 2 == 0 ? "UDP" : "TCP", i, i, "", "tavo:fuzz", 0, true});
     }
     Watched router(igd);
-    tavo::LeaseHabit habit;
+    tavo::Habits habit;
     tavo::Record record("", "boot");
     const tavo::PassResult result =
         tavo::BringInLine(router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] {}});
@@ -196,7 +199,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* pData, size_t nSize) {
     RequirePrintable(pIgd->Service().szType);
     RequirePrintable(pIgd->Service().model.szBrand + pIgd->Service().model.szModel + pIgd->Service().model.szVersion);
     std::string szAddress;
-    if (pIgd->ExternalAddress(szAddress) == tavo::kRouterOk) {
+    if (pIgd->ExternalAddress(szAddress) == tavo::kWireOk) {
         RequirePrintable(szAddress);
     }
     Map(*pIgd);

@@ -177,7 +177,7 @@ class Lab:
     def clear_state(*more):
         """What a save and the daemons leave behind."""
         for path in ("/etc/portforward/rule.conf", "/tmp/pfProgress", "/var/lib/tavo/upnp_igd.conf",
-                     "/var/lib/tavo/upnp_made.conf", "/var/lib/tavo/natpmp_held.conf", *more):
+                     "/var/lib/tavo/upnp_made.conf", "/var/lib/tavo/natpmp_made.conf", *more):
             if os.path.exists(path):
                 os.unlink(path)
 

@@ -42,7 +42,7 @@ def answer(opcode, port, external, lifetime):
         TABLE.pop(name, None)
         return head(opcode) + struct.pack("!HHI", port, 0, 0)
     TABLE[name] = external + (FAULT in ("other_port", "will_not_close"))
-    return head(opcode) + struct.pack("!HHI", port, TABLE[name], 2 if FAULT == "short_lease" else lifetime)
+    return head(opcode) + struct.pack("!HHI", port, TABLE[name], CODE if FAULT == "short_lease" else lifetime)
 
 
 def datagrams(request):

@@ -1,12 +1,12 @@
 // See model_router.h.
 #include "model_router.h"
 
+#include <algorithm>
+
 namespace model {
 
 namespace {
 
-constexpr int kNotAuthorized = 606;
-constexpr int kFull = 728;
 constexpr size_t kFirstEntries = 3;  // that a listing shows before it ends in a fault
 
 }  // namespace
@@ -23,20 +23,21 @@ const Router::Entry* Router::At(const tavo::MappingKey& key) {
 }
 
 template <typename Effect>
-int Router::Answer(Effect fnEffect) {
+Reply Router::Answer(Effect fnEffect) {
+    const Reply lost{tavo::Reply::kTimeout, "timeout"};
     ++nRequests;
     Expire();
     if (Chance(nKillPerMille)) {
         throw Killed();
     }
     if (blAway || Chance(nLosePerMille)) {
-        return tavo::kRouterTimeout;
+        return lost;
     }
-    const int nCode = fnEffect();
+    const Reply reply = fnEffect();
     if (Chance(nKillPerMille)) {
         throw Killed();
     }
-    return Chance(nLosePerMille) ? static_cast<int>(tavo::kRouterTimeout) : nCode;
+    return Chance(nLosePerMille) ? lost : reply;
 }
 
 tavo::RouterMapping Router::Shown(const Entry& entry) const {
@@ -49,69 +50,69 @@ tavo::RouterMapping Router::Shown(const Entry& entry) const {
     return shown;
 }
 
-int Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
-    return Answer([&] {
+Reply Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
+    if (habits.blBlind) {
+        return mAsked;
+    }
+    return Answer([&]() -> Reply {
         for (const auto& [key, entry] : mMapTable) {
-            if (habits.nListCode != tavo::kRouterOk && rgMappings.size() >= kFirstEntries) {
+            if (habits.enList != tavo::Reply::kOk && rgMappings.size() >= kFirstEntries) {
                 break;
             }
-            if (habits.nListCode <= tavo::kRouterOk && !Chance(nSkipPerMille)) {
+            if (habits.enList <= tavo::Reply::kTooLong && !Chance(nSkipPerMille)) {
                 rgMappings.push_back(Shown(entry));
             }
         }
-        return habits.nListCode;
+        return {habits.enList, "list"};
     });
 }
 
-int Router::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                      std::vector<tavo::RouterMapping>& rgMappings) {
+Reply Router::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                        std::vector<tavo::RouterMapping>& rgMappings) {
     if (!habits.blRanges) {
-        return tavo::kRouterInvalidAction;
+        return {tavo::Reply::kRefused, "401"};
     }
-    return Answer([&] {
+    return Answer([&]() -> Reply {
         for (const auto& [key, entry] : mMapTable) {
             if (key.first == szProtocol && key.second >= nFirst && key.second <= nLast &&
                 entry.mapping.szClient == szBox) {
                 rgMappings.push_back(Shown(entry));
             }
         }
-        return static_cast<int>(tavo::kRouterOk);
+        return {};
     });
 }
 
-int Router::Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) {
-    return Answer([&] {
+Reply Router::Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) {
+    return Answer([&]() -> Reply {
         const Entry* pEntry = At({szProtocol, nRouterPort});
         if (pEntry == nullptr) {
-            return static_cast<int>(tavo::kRouterNoSuchEntry);
+            return {tavo::Reply::kNoSuchEntry, "714"};
         }
         mapping = Shown(*pEntry);
-        return static_cast<int>(tavo::kRouterOk);
+        return {};
     });
 }
 
-int Router::DoAdd(const tavo::RouterMapping& mapping) {
-    if (mapping.szClient != szBox) {
-        szBroken = "a mapping for another host is asked for";
-    }
+Reply Router::DoAdd(const tavo::RouterMapping& mapping) {
     if (habits.blPermanentOnly && mapping.nLease != 0) {
-        return tavo::kRouterOnlyPermanentLeases;
+        return {tavo::Reply::kOnlyPermanent, "725"};
     }
     const tavo::MappingKey key = tavo::KeyOf(mapping);
     const Entry* pThere = At(key);
     if (pThere != nullptr) {
         const bool blSame = pThere->mapping.nBoxPort == mapping.nBoxPort;
         if (pThere->mapping.szClient != mapping.szClient || (!blSame && !habits.blOverwrites)) {
-            return tavo::kRouterConflict;
+            return {tavo::Reply::kConflict, "718"};
         }
         if (!pThere->blBox && !pThere->blOrphan) {
             szBroken = "another program's mapping is changed";
         }
         if (!blSame && habits.blSaysChanged) {
-            return tavo::kRouterOk;
+            return {};
         }
     } else if (mMapTable.size() >= habits.nCapacity) {
-        return habits.blSaysFull ? kFull : static_cast<int>(tavo::kRouterOk);
+        return habits.blSaysFull ? Reply{tavo::Reply::kRefused, "728"} : Reply{};
     }
     Entry& entry = mMapTable[key] = {mapping, 0, true};
     if (habits.nLongestLease != 0 && (mapping.nLease == 0 || mapping.nLease > habits.nLongestLease)) {
@@ -119,36 +120,75 @@ int Router::DoAdd(const tavo::RouterMapping& mapping) {
     }
     entry.nEnd = entry.mapping.nLease == 0 ? 0 : mNNow + entry.mapping.nLease;
     entry.mapping.szDescription = TextOf(mapping.szDescription);
-    return tavo::kRouterOk;
+    return {};
 }
 
-int Router::Add(const tavo::RouterMapping& mapping) {
+const Router::Entry* Router::OfBoxPort(const tavo::RouterMapping& mapping) const {
+    for (const auto& [key, entry] : mMapTable) {
+        if (entry.mapping.szClient == szBox && key.first == mapping.szProtocol &&
+            entry.mapping.nBoxPort == mapping.nBoxPort) {
+            return &entry;
+        }
+    }
+    return nullptr;
+}
+
+Reply Router::DoGrant(tavo::RouterMapping& mapping) {
+    const uint16_t nWanted = mapping.nRouterPort;
+    if (const Entry* pOwn = OfBoxPort(mapping)) {
+        mapping.nRouterPort = pOwn->mapping.nRouterPort;
+    } else if (mMapTable.size() >= habits.nCapacity) {
+        return {tavo::Reply::kRefused, "refused: out of resources"};
+    } else {
+        while (At(tavo::KeyOf(mapping)) != nullptr) {
+            ++mapping.nRouterPort;
+        }
+    }
+    if (habits.nLongestLease != 0) {
+        mapping.nLease = std::min(mapping.nLease, habits.nLongestLease);
+    }
+    mMapTable[tavo::KeyOf(mapping)] = {mapping, mNNow + mapping.nLease, true};
+    return mapping.nRouterPort == nWanted ? Reply{} : Reply{tavo::Reply::kElsewhere, "elsewhere"};
+}
+
+Reply Router::Add(tavo::RouterMapping& mapping) {
+    if (mapping.szClient != szBox) {
+        szBroken = "a mapping for another host is asked for";
+    }
     fnBeforeAdd(mapping);
-    const int nCode = Answer([&] { return DoAdd(mapping); });
+    const Reply reply = Answer([&] { return habits.blBlind ? DoGrant(mapping) : DoAdd(mapping); });
     fnTell("add " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " -> " + mapping.szClient + ":" +
-           std::to_string(mapping.nBoxPort) + " = " + std::to_string(nCode));
-    return nCode;
+           std::to_string(mapping.nBoxPort) + " = " + reply.szWord);
+    return reply;
 }
 
-int Router::DoRemove(const tavo::MappingKey& key) {
-    const Entry* pEntry = At(key);
+Reply Router::DoRemove(const tavo::RouterMapping& mapping) {
+    const Entry* pEntry = habits.blBlind ? OfBoxPort(mapping) : At(tavo::KeyOf(mapping));
     if (pEntry == nullptr) {
-        return tavo::kRouterNoSuchEntry;
+        return habits.blBlind ? Reply{} : Reply{tavo::Reply::kNoSuchEntry, "714"};
     }
     if (habits.blSecure && pEntry->mapping.szClient != szBox) {
-        return kNotAuthorized;
+        return {tavo::Reply::kRefused, "606"};
     }
     if (!pEntry->blBox && !pEntry->blOrphan) {
         szBroken = "somebody else's mapping is taken away";
     }
-    mMapTable.erase(key);
-    return tavo::kRouterOk;
+    mMapTable.erase(tavo::KeyOf(pEntry->mapping));
+    return {};
 }
 
-int Router::Remove(const std::string& szProtocol, uint16_t nRouterPort) {
-    const int nCode = Answer([&] { return DoRemove({szProtocol, nRouterPort}); });
-    fnTell("remove " + szProtocol + std::to_string(nRouterPort) + " = " + std::to_string(nCode));
-    return nCode;
+Reply Router::Remove(const tavo::RouterMapping& mapping) {
+    const bool blForeign = habits.blBlind && mapping.szClient != szBox;
+    const Reply reply = blForeign ? Reply{tavo::Reply::kRefused, "former"} : Answer([&] { return DoRemove(mapping); });
+    fnTell("remove " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " = " + reply.szWord);
+    return reply;
+}
+
+Reply Router::Ask(int& nLifeNow) {
+    return mAsked = Answer([&]() -> Reply {
+               nLifeNow = nLife;
+               return {};
+           });
 }
 
 }  // namespace model

@@ -14,6 +14,8 @@
 
 namespace model {
 
+using Reply = tavo::RouterReply;
+
 // Thrown where our process is killed: before or after a request took effect.
 struct Killed {};
 
@@ -26,10 +28,13 @@ struct Habits {
     bool blSecure = false;       // only the client may make, change and delete its entries
     bool blOverwrites = true;    // a client's own entry at its place; else 718 for any change
     size_t nCapacity = 1000;
-    bool blSaysFull = true;  // else it says yes and keeps nothing
-    int nListCode = 0;       // what a listing answers; below 0 with the first entries
+    bool blSaysFull = true;                 // else it says yes and keeps nothing
+    tavo::Reply enList = tavo::Reply::kOk;  // what a listing answers; kTooLong with the first entries
     bool blRanges = false;
     bool blSaysChanged = false;  // says yes to a change of its own entry, and keeps it as it was
+    // Shows nothing, lends everything, gives another port where the wanted one is taken, and knows a mapping by its
+    // client and the client's port.
+    bool blBlind = false;
 };
 
 class Router : public tavo::Router {
@@ -43,12 +48,15 @@ public:
         bool blOrphan = false;  // was made by it, and nobody can know that any more
     };
 
-    int List(std::vector<tavo::RouterMapping>& rgMappings) override;
-    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                  std::vector<tavo::RouterMapping>& rgMappings) override;
-    int Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override;
-    int Add(const tavo::RouterMapping& mapping) override;
-    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override;
+    tavo::Abilities What() const override { return {!habits.blBlind, habits.blBlind, habits.blBlind}; }
+    Reply List(std::vector<tavo::RouterMapping>& rgMappings) override;
+    Reply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                    std::vector<tavo::RouterMapping>& rgMappings) override;
+    Reply Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override;
+    Reply Add(tavo::RouterMapping& mapping) override;
+    Reply Remove(const tavo::RouterMapping& mapping) override;
+    // A question that changes nothing.
+    Reply Ask(int& nLifeNow);
 
     // How the router keeps a description.
     std::string TextOf(const std::string& szText) const {
@@ -61,7 +69,10 @@ public:
     void Expire();
     // What is there now, without asking.
     const Entry* At(const tavo::MappingKey& key);
-    void Restart() { mMapTable.clear(); }
+    void Restart() {
+        mMapTable.clear();
+        ++nLife;
+    }
 
     Habits habits;
     std::string szBox;      // who asks
@@ -70,6 +81,7 @@ public:
     int nKillPerMille = 0;  // requests at which our process dies
     int nSkipPerMille = 0;  // entries that a listing leaves out, because somebody else changes the table meanwhile
     std::map<tavo::MappingKey, Entry> mMapTable;
+    int nLife = 0;  // since its last restart, as a blind one's clock tells it
     int nRequests = 0;
     std::function<void(std::string)> fnTell;  // each change that is asked for
     std::function<void(const tavo::RouterMapping&)> fnBeforeAdd;
@@ -79,11 +91,15 @@ private:
     bool Chance(int nPerMille) { return static_cast<int>(mRandom() % 1000) < nPerMille; }
     // What becomes of a request before it takes effect, and of its answer afterwards.
     template <typename Effect>
-    int Answer(Effect fnEffect);
+    Reply Answer(Effect fnEffect);
     tavo::RouterMapping Shown(const Entry& entry) const;
-    int DoAdd(const tavo::RouterMapping& mapping);
-    int DoRemove(const tavo::MappingKey& key);
+    Reply DoAdd(const tavo::RouterMapping& mapping);
+    // As one that knows a mapping by its client and the client's port, and shows none.
+    Reply DoGrant(tavo::RouterMapping& mapping);
+    Reply DoRemove(const tavo::RouterMapping& mapping);
+    const Entry* OfBoxPort(const tavo::RouterMapping& mapping) const;
 
+    Reply mAsked;
     std::mt19937& mRandom;
     const int64_t& mNNow;
 };

@@ -41,10 +41,14 @@ public:
         habits.blOverwrites = !OneIn(3);
         habits.nCapacity = OneIn(4) ? 4 + Pick(8) : 1000;
         habits.blSaysFull = OneIn(2);
-        const int rgListCodes[] = {0, 0, 0, tavo::kRouterTooLong, 401, 501};
-        habits.nListCode = rgListCodes[Pick(6)];
+        const tavo::Reply rgLists[] = {tavo::Reply::kOk,      tavo::Reply::kOk,      tavo::Reply::kOk,
+                                       tavo::Reply::kTooLong, tavo::Reply::kRefused, tavo::Reply::kRefused};
+        habits.enList = rgLists[Pick(6)];
         habits.blRanges = OneIn(3);
         habits.blSaysChanged = OneIn(6);
+        habits.blBlind = OneIn(4);
+        habits.blSecure = habits.blSecure || habits.blBlind;
+        habits.blForgetsLease = habits.blForgetsLease && !habits.blBlind;
         mBlHardware = !OneIn(5);
         mNCheck = OneIn(2) ? 120 : 600;
         mRouter.szBox = "192.168.1.5";
@@ -87,6 +91,8 @@ private:
         }
         mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
         mHabit = {};
+        mMapLives.clear();
+        mBlDoubtful = true;
         mNNext = mNNow;
         Trouble();
     }
@@ -179,9 +185,10 @@ private:
         std::set<MappingKey> setKeys;
         for (unsigned i = Pick(8); i > 0; --i) {
             const MappingKey key = AnyKey();
+            // A blind router lends one port for each of the box.
+            const auto nBoxPort = static_cast<uint16_t>(100 + (mRouter.habits.blBlind ? i : Pick(3)));
             if (setKeys.insert(key).second) {
-                mRgWanted.push_back({key.first, key.second, static_cast<uint16_t>(100 + Pick(3)), "",
-                                     OneIn(2) ? "tavo:a" : "tavo:b", 0, true});
+                mRgWanted.push_back({key.first, key.second, nBoxPort, "", OneIn(2) ? "tavo:a" : "tavo:b", 0, true});
             }
         }
         Tell(std::to_string(mRgWanted.size()) + " rules");
@@ -206,6 +213,7 @@ private:
     // Another device at the gateway's address, and the first one again.
     void SwapRouters() {
         std::swap(mRouter.mMapTable, mMapOther);
+        std::swap(mRouter.nLife, mNOtherLife);
         mBlOther = !mBlOther;
         if (!mBlHardware) {  // nothing tells one from the other
             Orphan(mRouter.mMapTable);
@@ -223,12 +231,13 @@ private:
         const int64_t nAllowance =
             mRouter.nLosePerMille + mRouter.nKillPerMille + mRouter.nSkipPerMille + (mRouter.blAway ? 1 : 0) + mNStopIn;
         mPRecord->TurnTo(Name());
-        mPRecord->Prune(mNNow - mNBootAt);
+        mPRecord->Prune(mNNow - mNBootAt, mRouter.habits.blBlind);
         const std::string szRecordBefore = mPRecord->Text();
         mNAdds = 0;
         mHabit.nLease = 3600;
         tavo::PassResult result;
         try {
+            Ask();
             result = tavo::BringInLine(mRouter, mRgWanted, *mPRecord, mHabit,
                                        {mRouter.szBox, [this] { return mNNow - mNBootAt; },
                                         [this] { return mNStopIn > 0 && --mNStopIn == 0; }, [this] { Save(); }});
@@ -242,7 +251,8 @@ private:
         }
         mRouter.nKillPerMille = 0;
         mNStopIn = 0;
-        const bool blWell = result.nTransport == tavo::kRouterOk && !result.blStopped;
+        const bool blWell = result.transport.IsOk() && !result.blStopped;
+        mBlDoubtful = mBlDoubtful || !result.transport.IsOk();
         const int nNext = result.nNextSeconds > 0 ? std::min(mNCheck, result.nNextSeconds) : mNCheck;
         mNNext = mNNow + (blWell ? nNext : std::min(mNCheck, kRetrySeconds));
         mNPeace = nAllowance == 0 && blWell ? mNPeace + 1 : 0;
@@ -251,12 +261,35 @@ private:
         if (mNPeace >= kPassesToPeace) {
             CheckPeace(result);
         }
-        if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.nListCode == tavo::kRouterOk) {
+        if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.enList == tavo::Reply::kOk) {
             CheckCost(result, mRouter.nRequests - nRequestsBefore, mPRecord->Text() != szRecordBefore);
         } else {
             mBlAllOpen = false;
         }
         mBlQuiet = mBlQuiet || mNPeace >= kPassesToPeace;
+    }
+
+    // What natpmpd learns of a blind router before it asks for anything.
+    void Ask() {
+        int nLife = 0;
+        if (!mRouter.habits.blBlind) {
+            return;
+        }
+        const bool blHeard = mRouter.Ask(nLife).IsOk();
+        const auto it = mMapLives.find(Name().szHardware);
+        if (blHeard && it != mMapLives.end() && it->second != nLife) {
+            mPRecord->Lose(mRouter.szBox);
+        } else if (mBlDoubtful) {
+            mPRecord->Doubt();
+        }
+        if (mBlDoubtful || mNNow - mNAskedElsewhere > mHabit.nLease / 2) {
+            mHabit.mapElsewhere.clear();
+            mNAskedElsewhere = mNNow;
+        }
+        if (blHeard) {
+            mMapLives[Name().szHardware] = nLife;
+        }
+        mBlDoubtful = !blHeard;
     }
 
     void Save() {
@@ -341,11 +374,17 @@ private:
             }
         }
         std::set<MappingKey> setNamed;
+        std::set<MappingKey> setBoxPorts;
         for (const tavo::Outcome& outcome : result.rgOutcomes) {
             setNamed.emplace(outcome.szProtocol, outcome.nRouterPort);
+            setBoxPorts.emplace(outcome.szProtocol, outcome.nBoxPort);
         }
         for (const auto& [key, entry] : mRouter.mMapTable) {
-            if (entry.blBox && mRouter.At(key) != nullptr && !setNamed.contains(key)) {
+            // A blind one may have lent another port than was asked for, and the answer was lost: the box's port is
+            // known.
+            const bool blNamed = setNamed.contains(key) ||
+                                 (mRouter.habits.blBlind && setBoxPorts.contains({key.first, entry.mapping.nBoxPort}));
+            if (entry.blBox && mRouter.At(key) != nullptr && !blNamed) {
                 Broken("ours, wanted by no rule, and not named", key);
             }
         }
@@ -362,7 +401,12 @@ private:
             const bool blFree = pEntry == nullptr ? nUsed < mRouter.habits.nCapacity
                                                   : pEntry->blBox && (pEntry->mapping.szClient == mRouter.szBox ||
                                                                       !mRouter.habits.blSecure);
-            if (blFree && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
+            // Elsewhere, or for the former address: what a blind one says at one asking is not asked for again at once.
+            const auto made = mPRecord->Here().find(key);
+            const bool blWaits =
+                mRouter.habits.blBlind && (mHabit.mapElsewhere.contains(key) ||
+                                           (made != mPRecord->Here().end() && made->second.szClient != mRouter.szBox));
+            if (blFree && !blWaits && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
                 Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
             }
         }
@@ -380,6 +424,10 @@ private:
     int64_t mNNow = 1000000;
     model::Router mRouter;
     std::map<MappingKey, model::Router::Entry> mMapOther;
+    int mNOtherLife = 1 << 20;             // of the other router
+    std::map<std::string, int> mMapLives;  // of each router, as it was last heard
+    bool mBlDoubtful = true;               // what a blind one granted may be gone
+    int64_t mNAskedElsewhere = 0;
     bool mBlOther = false;
     std::vector<RouterMapping> mRgWanted;
     bool mBlHardware = true;  // the routers can be told apart
@@ -391,7 +439,7 @@ private:
     std::set<MappingKey> mSetOpen;  // at the last look
     std::string mSzDisk;
     std::unique_ptr<tavo::Record> mPRecord;
-    tavo::LeaseHabit mHabit;
+    tavo::Habits mHabit;
     int mNBoots = 0;
     int64_t mNBootAt = 0;
     int64_t mNNext = 0;

@@ -8,7 +8,7 @@ import sys
 SOURCE, BUILD, PLATFORM, LIBRARY = (os.path.realpath(path) for path in sys.argv[1:5])
 SEAM = "platform/include/"
 GROUND = ["ground/", SEAM]
-WIRE = ["wire/", "mapping/Router.h", *GROUND]
+WIRE = ["wire/", *GROUND]
 MAPPING = ["mapping/", *GROUND]
 
 # The longest prefix counts.
@@ -18,7 +18,7 @@ MAY_KNOW = {
     "ground/": GROUND,
     "wire/": WIRE,
     "mapping/": MAPPING,
-    "mapping/Plan.cpp": ["mapping/"],
+    "mapping/Plan.cpp": ["mapping/", "ground/Marks.h"],
     "programs/": ["programs/common/", *WIRE, *MAPPING],
     "cli/": ["cli/", "include/", SEAM],
     "tests/": [""],

@@ -1,5 +1,5 @@
 // NAT-PMP requests, one at a time, each with its answer or the reason why there is none.
-// Relies on libnatpmp. Promises: see NatpmpClient.h.
+// Relies on libnatpmp. Promises: see Client.h.
 #include "wire/pcp/Client.h"
 
 #include <arpa/inet.h>
@@ -25,18 +25,18 @@ constexpr int kMostPollMilliseconds = 100;  // so that a stop is seen soon
 // What reading found when it found no end yet: no code of ours, of the library's or of the protocol's.
 enum Unfinished : int { kNotYet = 1 << 16, kForeign };
 
-constexpr std::pair<int, int> kCodes[] = {{0, kRouterOk},
+constexpr std::pair<int, int> kCodes[] = {{0, kWireOk},
                                           {NATPMP_TRYAGAIN, kNotYet},
                                           {NATPMP_ERR_UNSUPPORTEDVERSION, kNatpmpUnsupportedVersion},
                                           {NATPMP_ERR_NOTAUTHORIZED, kNatpmpNotAuthorised},
                                           {NATPMP_ERR_NETWORKFAILURE, kNatpmpNetworkFailure},
                                           {NATPMP_ERR_OUTOFRESOURCES, kNatpmpOutOfResources},
                                           {NATPMP_ERR_UNSUPPORTEDOPCODE, kNatpmpUnsupportedOpcode},
-                                          {NATPMP_ERR_NOGATEWAYSUPPORT, kRouterTimeout}};  // after its last sending
+                                          {NATPMP_ERR_NOGATEWAYSUPPORT, kWireTimeout}};  // after its last sending
 
-constexpr std::pair<int, const char*> kWords[] = {{kRouterTimeout, "no answer from the gateway"},
-                                                  {kRouterUnreachable, "the gateway cannot be reached by NAT-PMP"},
-                                                  {kRouterGarbage, "senseless answers from the gateway"},
+constexpr std::pair<int, const char*> kWords[] = {{kWireTimeout, "no answer from the gateway"},
+                                                  {kWireUnreachable, "the gateway cannot be reached by NAT-PMP"},
+                                                  {kWireGarbage, "senseless answers from the gateway"},
                                                   {kNatpmpUnsupportedVersion, "refused: unsupported version"},
                                                   {kNatpmpNotAuthorised, "refused: not authorised"},
                                                   {kNatpmpNetworkFailure, "refused: network failure"},
@@ -84,7 +84,7 @@ int CodeOf(int nLibrary, const natpmpresp_t& answer) {
             return nCode;
         }
     }
-    return kRouterUnreachable;
+    return kWireUnreachable;
 }
 
 }  // namespace
@@ -116,7 +116,7 @@ int NatpmpClient::Read(const NatpmpQuestion& question, natpmpresp_t& answer) {
     uint8_t rgDatagram[kMappingAnswerSize] = {};
     const ssize_t nSize = recv(mHandle.s, rgDatagram, sizeof(rgDatagram), MSG_PEEK | MSG_TRUNC | MSG_DONTWAIT);
     if (nSize < 0 && errno != EAGAIN) {
-        return kRouterUnreachable;  // above all: nobody listens at the gateway's port
+        return kWireUnreachable;  // above all: nobody listens at the gateway's port
     }
     if (nSize >= 0 && !IsAnswer(rgDatagram, nSize, question)) {
         recv(mHandle.s, nullptr, 0, MSG_DONTWAIT);  // a datagram is gone when any of it was read
@@ -127,10 +127,10 @@ int NatpmpClient::Read(const NatpmpQuestion& question, natpmpresp_t& answer) {
 
 int NatpmpClient::Ask(const NatpmpQuestion& question, int nSent, natpmpresp_t& answer) {
     if (nSent < 0) {
-        return kRouterUnreachable;
+        return kWireUnreachable;
     }
     const auto end = std::chrono::steady_clock::now() + kAnswerLimit;
-    int nFailure = kRouterTimeout;
+    int nFailure = kWireTimeout;
     while (std::chrono::steady_clock::now() < end && !mFnStop()) {
         timeval left = {};
         getnatpmprequesttimeout(&mHandle, &left);
@@ -138,23 +138,22 @@ int NatpmpClient::Ask(const NatpmpQuestion& question, int nSent, natpmpresp_t& a
         pollfd waiting = {mHandle.s, POLLIN, 0};
         poll(&waiting, 1, static_cast<int>(std::clamp<long>(nLeft, kLeastPollMilliseconds, kMostPollMilliseconds)));
         const int nCode = Read(question, answer);
-        if (nCode == kRouterOk) {
+        if (nCode == kWireOk) {
             mFnEpoch(answer.epoch);
         }
         if (nCode != kNotYet && nCode != kForeign) {
             return nCode;
         }
-        nFailure = nCode == kForeign ? kRouterGarbage : nFailure;
+        nFailure = nCode == kForeign ? kWireGarbage : nFailure;
     }
     return nFailure;
 }
 
 int NatpmpClient::AskAddress(std::string& szAddress) {
     natpmpresp_t answer = {};
-    const int nCode =
-        mBlOpen ? Ask({0, 0, false}, sendpublicaddressrequest(&mHandle), answer) : int{kRouterUnreachable};
+    const int nCode = mBlOpen ? Ask({0, 0, false}, sendpublicaddressrequest(&mHandle), answer) : int{kWireUnreachable};
     char szText[INET_ADDRSTRLEN] = {};
-    if (nCode == kRouterOk) {
+    if (nCode == kWireOk) {
         szAddress = inet_ntop(AF_INET, &answer.pnu.publicaddress.addr, szText, sizeof(szText));
     }
     return nCode;
@@ -163,7 +162,7 @@ int NatpmpClient::AskAddress(std::string& szAddress) {
 int NatpmpClient::AskMapping(const std::string& szProtocol, uint16_t nBoxPort, uint16_t nRouterPort, uint32_t nLifetime,
                              natpmpresp_t& answer) {
     if (!mBlOpen) {
-        return kRouterUnreachable;
+        return kWireUnreachable;
     }
     const uint8_t nOpcode = szProtocol == "TCP" ? NATPMP_PROTOCOL_TCP : NATPMP_PROTOCOL_UDP;
     const int nSent = sendnewportmappingrequest(&mHandle, nOpcode, nBoxPort, nRouterPort, nLifetime);
@@ -174,7 +173,7 @@ int NatpmpClient::Map(const std::string& szProtocol, uint16_t nBoxPort, uint16_t
                       NatpmpGrant& grant) {
     natpmpresp_t answer = {};
     const int nCode = AskMapping(szProtocol, nBoxPort, nRouterPort, nLifetime, answer);
-    if (nCode == kRouterOk) {
+    if (nCode == kWireOk) {
         grant = {answer.pnu.newportmapping.mappedpublicport, answer.pnu.newportmapping.lifetime};
     }
     return nCode;

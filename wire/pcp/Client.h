@@ -1,7 +1,7 @@
 // Speaks NAT-PMP to one gateway. Relies on libnatpmp, which sends and sends again, and on a look at each
 // datagram before the library takes it: the library checks neither its length nor what it answers.
 // Promises: every call is bounded in time; an answer is one to the question asked, from the gateway's
-// own port; outputs are set only with kRouterOk.
+// own port; outputs are set only with kWireOk.
 #pragma once
 
 #include <natpmp.h>
@@ -10,11 +10,11 @@
 #include <functional>
 #include <string>
 
-#include "mapping/Router.h"
+#include "wire/Answer.h"
 
 namespace tavo {
 
-// The protocol's own result codes; they come beside those of RouterCode.
+// The protocol's own result codes; they come beside those of WireCode.
 enum NatpmpCode : int {
     kNatpmpUnsupportedVersion = 1,
     kNatpmpNotAuthorised = 2,
@@ -50,7 +50,7 @@ public:
     // szProtocol: "TCP" or "UDP". The gateway may grant another router port and another lifetime.
     int Map(const std::string& szProtocol, uint16_t nBoxPort, uint16_t nRouterPort, uint32_t nLifetime,
             NatpmpGrant& grant);
-    // Every mapping of the box's port goes, whatever its router port. No such mapping: kRouterOk.
+    // Every mapping of the box's port goes, whatever its router port. No such mapping: kWireOk.
     int Unmap(const std::string& szProtocol, uint16_t nBoxPort);
 
 private:

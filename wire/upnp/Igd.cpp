@@ -174,13 +174,13 @@ int CodeOf(const HttpAnswer& answer) {
         case HttpEnd::kAnswered:
             return SoapCode(answer.nCode, answer.szBody);
         case HttpEnd::kTimeout:
-            return kRouterTimeout;
+            return kWireTimeout;
         case HttpEnd::kUnreachable:
-            return kRouterUnreachable;
+            return kWireUnreachable;
         case HttpEnd::kGarbage:
             break;
     }
-    return kRouterGarbage;
+    return kWireGarbage;
 }
 
 bool IsAddress(const std::string& szText) {
@@ -189,7 +189,7 @@ bool IsAddress(const std::string& szText) {
 }
 
 // What an entry's answer says beyond its key.
-bool ReadEntry(const XMLElement* pRoot, RouterMapping& mapping) {
+bool ReadEntry(const XMLElement* pRoot, IgdEntry& mapping) {
     const auto nBoxPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewInternalPort")));
     mapping.szClient = TextOf(FindElement(pRoot, "NewInternalClient"));
     if (!nBoxPort || !IsAddress(mapping.szClient)) {
@@ -203,7 +203,7 @@ bool ReadEntry(const XMLElement* pRoot, RouterMapping& mapping) {
     return true;
 }
 
-bool ReadKey(const XMLElement* pRoot, RouterMapping& mapping) {
+bool ReadKey(const XMLElement* pRoot, IgdEntry& mapping) {
     const auto nRouterPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewExternalPort")));
     mapping.szProtocol = TextOf(FindElement(pRoot, "NewProtocol"));
     mapping.nRouterPort = nRouterPort.value_or(0);
@@ -211,19 +211,19 @@ bool ReadKey(const XMLElement* pRoot, RouterMapping& mapping) {
 }
 
 // The entries of a listing, which is a document inside the answer. Those that make no sense are left out.
-std::vector<RouterMapping> ParseListing(const std::string& szAnswer) {
+std::vector<IgdEntry> ParseListing(const std::string& szAnswer) {
     XMLDocument document;
     document.Parse(szAnswer.data(), szAnswer.size());
     const XMLElement* pListing = FindElement(document.RootElement(), "NewPortListing");
     const char* szListing = pListing == nullptr ? nullptr : pListing->GetText();
     XMLDocument listing;
-    std::vector<RouterMapping> rgMappings;
+    std::vector<IgdEntry> rgMappings;
     if (szListing == nullptr || listing.Parse(szListing) != tinyxml2::XML_SUCCESS) {
         return rgMappings;
     }
     const XMLElement* pEntry = listing.RootElement() == nullptr ? nullptr : listing.RootElement()->FirstChildElement();
     for (; pEntry != nullptr; pEntry = pEntry->NextSiblingElement()) {
-        RouterMapping mapping;
+        IgdEntry mapping;
         const XMLElement* pFields = pEntry->FirstChildElement();
         if (ReadKey(pFields, mapping) && ReadEntry(pFields, mapping)) {
             rgMappings.push_back(std::move(mapping));
@@ -255,13 +255,13 @@ std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpU
 int SoapCode(long nHttpCode, const std::string& szXml) {
     XMLDocument document;
     if (document.Parse(szXml.data(), szXml.size()) != tinyxml2::XML_SUCCESS || document.RootElement() == nullptr) {
-        return kRouterGarbage;
+        return kWireGarbage;
     }
     if (FindElement(document.RootElement(), "Fault") == nullptr) {
-        return nHttpCode == 200 && FindElement(document.RootElement(), "Body") != nullptr ? kRouterOk : kRouterGarbage;
+        return nHttpCode == 200 && FindElement(document.RootElement(), "Body") != nullptr ? kWireOk : kWireGarbage;
     }
     const auto nCode = ParseNumber<int>(TextOf(FindElement(document.RootElement(), "errorCode")));
-    return nCode && *nCode >= kLeastErrorCode ? *nCode : kRouterGarbage;
+    return nCode && *nCode >= kLeastErrorCode ? *nCode : kWireGarbage;
 }
 
 std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp) {
@@ -321,55 +321,55 @@ int Igd::Call(const char* szAction, const std::vector<Argument>& rgArguments, st
     return CodeOf(answer);
 }
 
-int Igd::GetAt(int nIndex, RouterMapping& mapping) {
+int Igd::GetAt(int nIndex, IgdEntry& mapping) {
     std::string szAnswer;
     const int nCode = Call("GetGenericPortMappingEntry", {{"NewPortMappingIndex", std::to_string(nIndex)}}, szAnswer);
-    if (nCode != kRouterOk) {
+    if (nCode != kWireOk) {
         return nCode;
     }
     XMLDocument document;
-    RouterMapping read;
+    IgdEntry read;
     document.Parse(szAnswer.data(), szAnswer.size());
     if (!ReadKey(document.RootElement(), read) || !ReadEntry(document.RootElement(), read)) {
         read = {};
         read.blEnabled = false;
     }
     mapping = std::move(read);
-    return kRouterOk;
+    return kWireOk;
 }
 
 int Igd::ExternalAddress(std::string& szAddress) {
     std::string szAnswer;
     const int nCode = Call("GetExternalIPAddress", {}, szAnswer);
-    if (nCode != kRouterOk) {
+    if (nCode != kWireOk) {
         return nCode;
     }
     XMLDocument document;
     document.Parse(szAnswer.data(), szAnswer.size());
     const std::string szRead = TextOf(FindElement(document.RootElement(), "NewExternalIPAddress"));
     if (!IsAddress(szRead)) {
-        return kRouterGarbage;
+        return kWireGarbage;
     }
     szAddress = szRead;
-    return kRouterOk;
+    return kWireOk;
 }
 
-int Igd::List(std::vector<RouterMapping>& rgMappings) {
+int Igd::List(std::vector<IgdEntry>& rgMappings) {
     const auto end = std::chrono::steady_clock::now() + kListLimit;
-    std::vector<RouterMapping> rgRead;
+    std::vector<IgdEntry> rgRead;
     std::map<std::pair<std::string, uint16_t>, size_t> mapSeen;
     for (int i = 0; i < kMaxEntries; ++i) {
         if (std::chrono::steady_clock::now() > end) {
             rgMappings = std::move(rgRead);
-            return kRouterTooLong;
+            return kWireTooLong;
         }
-        RouterMapping mapping;
+        IgdEntry mapping;
         const int nCode = GetAt(i, mapping);
         // The end of the table; some routers say so with the codes for bad arguments or no entry.
-        if (nCode == kRouterNoSuchIndex || nCode == kRouterNoSuchEntry || (nCode == kRouterInvalidArgs && i > 0)) {
+        if (nCode == kIgdNoSuchIndex || nCode == kIgdNoSuchEntry || (nCode == kIgdInvalidArgs && i > 0)) {
             break;
         }
-        if (nCode != kRouterOk) {
+        if (nCode != kWireOk) {
             return nCode;
         }
         if (mapping.szProtocol.empty()) {
@@ -380,23 +380,22 @@ int Igd::List(std::vector<RouterMapping>& rgMappings) {
             // A router that ignores the index would go on for ever, and one whose table has grown meanwhile shows the
             // same once more: either way this is not the whole table. Another entry of the port is for one host
             // outside.
-            const RouterMapping& seen = rgRead[it->second];
+            const IgdEntry& seen = rgRead[it->second];
             if (seen.szClient == mapping.szClient && seen.nBoxPort == mapping.nBoxPort) {
                 rgMappings = std::move(rgRead);
-                return kRouterTooLong;
+                return kWireTooLong;
             }
             continue;
         }
         rgRead.push_back(std::move(mapping));
     }
     rgMappings = std::move(rgRead);
-    return kRouterOk;
+    return kWireOk;
 }
 
-int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                   std::vector<RouterMapping>& rgMappings) {
+int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast, std::vector<IgdEntry>& rgMappings) {
     if (!mBlRanges) {
-        return kRouterInvalidAction;
+        return kIgdInvalidAction;
     }
     std::string szAnswer;
     const int nCode = Call("GetListOfPortMappings",
@@ -406,35 +405,35 @@ int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLas
                             {"NewManage", "0"},
                             {"NewNumberOfPorts", "0"}},
                            szAnswer);
-    mBlRanges = nCode == kRouterOk;
-    if (nCode == kRouterOk) {
+    mBlRanges = nCode == kWireOk;
+    if (nCode == kWireOk) {
         rgMappings = ParseListing(szAnswer);
     }
     return nCode;
 }
 
-int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) {
+int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping) {
     std::string szAnswer;
     const int nCode =
         Call("GetSpecificPortMappingEntry",
              {{"NewRemoteHost", ""}, {"NewExternalPort", std::to_string(nRouterPort)}, {"NewProtocol", szProtocol}},
              szAnswer);
-    if (nCode != kRouterOk) {
+    if (nCode != kWireOk) {
         return nCode;
     }
     XMLDocument document;
     document.Parse(szAnswer.data(), szAnswer.size());
-    RouterMapping read;
+    IgdEntry read;
     read.szProtocol = szProtocol;
     read.nRouterPort = nRouterPort;
     if (!ReadEntry(document.RootElement(), read)) {
-        return kRouterGarbage;
+        return kWireGarbage;
     }
     mapping = std::move(read);
-    return kRouterOk;
+    return kWireOk;
 }
 
-int Igd::Add(const RouterMapping& mapping) {
+int Igd::Add(const IgdEntry& mapping) {
     std::string szAnswer;
     return Call("AddPortMapping",
                 {{"NewRemoteHost", ""},

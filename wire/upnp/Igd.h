@@ -7,10 +7,31 @@
 #include <optional>
 #include <string>
 
-#include "mapping/Router.h"
+#include "wire/Answer.h"
 #include "wire/http/Http.h"
 
 namespace tavo {
+
+// An entry of the router's table.
+struct IgdEntry {
+    std::string szProtocol;  // "TCP" or "UDP"
+    uint16_t nRouterPort = 0;
+    uint16_t nBoxPort = 0;
+    std::string szClient;       // dotted address of the host behind the port
+    std::string szDescription;  // printable, bounded
+    uint32_t nLease = 0;        // seconds; 0: until the router restarts
+    bool blEnabled = true;
+};
+
+// The protocol's own codes; they come beside those of WireCode.
+enum IgdCode : int {
+    kIgdInvalidAction = 401,
+    kIgdInvalidArgs = 402,
+    kIgdNoSuchIndex = 713,
+    kIgdNoSuchEntry = 714,
+    kIgdConflict = 718,
+    kIgdOnlyPermanentLeases = 725
+};
 
 // What a router says it is, in its root device. A text that is too long keeps its beginning and gets a
 // mark of the whole at its end, so that two routers never become one.
@@ -30,10 +51,12 @@ struct IgdService {
 // Nothing when the description is unreadable, offers none, or sends us to another host.
 std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
 
-// The error code of a SOAP answer (0 for none), or kRouterGarbage.
+// The error code of a SOAP answer (0 for none), or kWireGarbage.
 int SoapCode(long nHttpCode, const std::string& szXml);
 
-class Igd : public Router {
+// Every call answers a WireCode, or the protocol's own code. Outputs are set only with kWireOk; with kWireTooLong,
+// List() has what was read.
+class Igd {
 public:
     // The IGD at the gateway, found within the limit or not at all. A description is waited for as long as
     // half of what is left of the limit, so that one that never comes does not keep the others from being
@@ -50,15 +73,16 @@ public:
     // What ends calls early from now on, as HttpTransport says.
     void SetStop(const std::function<bool()>& fnStop) { mPHttp->SetStop(fnStop); }
     // The entry at an index. One that makes no sense comes back disabled and without a protocol.
-    int GetAt(int nIndex, RouterMapping& mapping);
+    int GetAt(int nIndex, IgdEntry& mapping);
     // The router's address on its other side, as it says itself.
     int ExternalAddress(std::string& szAddress);
-    int List(std::vector<RouterMapping>& rgMappings) override;
-    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                  std::vector<RouterMapping>& rgMappings) override;
-    int Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) override;
-    int Add(const RouterMapping& mapping) override;
-    int Remove(const std::string& szProtocol, uint16_t nRouterPort) override;
+    int List(std::vector<IgdEntry>& rgMappings);
+    // The box's own entries between two ports, where the router can show them at once. May leave some out: what it
+    // shows is there, what it does not show may be there too.
+    int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast, std::vector<IgdEntry>& rgMappings);
+    int Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping);
+    int Add(const IgdEntry& mapping);
+    int Remove(const std::string& szProtocol, uint16_t nRouterPort);
 
     const IgdService& Service() const { return mService; }
 

@@ -64,19 +64,6 @@ bool RemoveTestRules() {
     return unlink(kTestRules) == 0 || errno == ENOENT;
 }
 
-bool IsTestMapping(const RouterMapping& entry, const std::string& szBox) {
-    return entry.szClient == szBox && entry.szDescription.starts_with(kTestPrefix);
-}
-
-int ShowsRule(Router& router, const TestRule& rule, const std::string& szBox, bool& blShown) {
-    RouterMapping entry;
-    const int nCode = router.Get("TCP", rule.nRouterPort, entry);
-    if (nCode >= 0) {  // whatever code it gives for an entry, it does not show one
-        blShown = nCode == kRouterOk && entry.szClient == szBox && entry.nBoxPort == rule.nBoxPort && entry.blEnabled;
-    }
-    return nCode;
-}
-
 bool IsStepUnderWay(const char* szStep) {
     char szWord[16] = {};
     return TLIBCFileGetKeyValue(kTestProgress, szStep, szWord, sizeof(szWord), 0) >= 1 &&

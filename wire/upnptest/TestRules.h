@@ -10,8 +10,6 @@
 #include <string_view>
 #include <vector>
 
-#include "mapping/Router.h"
-
 namespace tavo {
 
 inline constexpr char kTestDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";  // its whole command line
@@ -45,11 +43,6 @@ struct TestRule {
 std::vector<TestRule> LoadTestRules();
 bool SaveTestRules(const std::vector<TestRule>& rgRules);
 bool RemoveTestRules();
-
-// Whether an entry of the router's table is a test's, of the box's own.
-bool IsTestMapping(const RouterMapping& entry, const std::string& szBox);
-// Whether the router shows the mapping of a rule as the box's own. Below 0: it did not answer.
-int ShowsRule(Router& router, const TestRule& rule, const std::string& szBox, bool& blShown);
 
 // Whether the progress file says that a step is being worked at.
 bool IsStepUnderWay(const char* szStep);

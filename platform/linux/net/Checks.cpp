@@ -103,7 +103,7 @@ std::optional<in_addr> AskUpnp() {
     if (pIgd != nullptr) {
         pIgd->SetCallLimit(kUpnpMilliseconds);
     }
-    if (pIgd == nullptr || pIgd->ExternalAddress(szAddress) != tavo::kRouterOk) {
+    if (pIgd == nullptr || pIgd->ExternalAddress(szAddress) != tavo::kWireOk) {
         return std::nullopt;
     }
     const in_addr address = AddressOf(szAddress);

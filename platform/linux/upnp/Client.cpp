@@ -32,7 +32,7 @@ struct Client {
     std::unique_ptr<tavo::Igd> pIgd;
     std::optional<Clock::time_point> walkStart;
     std::set<std::pair<std::string, uint16_t>> setRead;  // since the walk began
-    tavo::RouterMapping last;
+    tavo::IgdEntry last;
     bool blLast = false;
 };
 
@@ -49,33 +49,33 @@ Client* Own() {
 }
 
 // The entry at an index, told once: a router that ignores the index has no second entry.
-int ReadEntry(Client& client, int nIndex, tavo::RouterMapping& mapping) {
+int ReadEntry(Client& client, int nIndex, tavo::IgdEntry& mapping) {
     if (nIndex == 0 || !client.walkStart) {
         client.walkStart = Clock::now();
         client.setRead.clear();
     }
     client.blLast = false;
     if (Clock::now() - *client.walkStart > kTableLimit) {
-        return tavo::kRouterTimeout;
+        return tavo::kWireTimeout;
     }
     const int nCode = client.pIgd->GetAt(nIndex, mapping);
-    if (nCode != tavo::kRouterOk) {
+    if (nCode != tavo::kWireOk) {
         return nCode;
     }
     if (!mapping.szProtocol.empty() && !client.setRead.emplace(mapping.szProtocol, mapping.nRouterPort).second) {
-        return tavo::kRouterNoSuchIndex;
+        return tavo::kIgdNoSuchIndex;
     }
     client.last = mapping;
     client.blLast = true;
-    return tavo::kRouterOk;
+    return tavo::kWireOk;
 }
 
 // What was read by its index a moment ago is complete and needs no second question.
-int FindEntry(Client& client, const std::string& szProtocol, uint16_t nPort, tavo::RouterMapping& mapping) {
+int FindEntry(Client& client, const std::string& szProtocol, uint16_t nPort, tavo::IgdEntry& mapping) {
     if (client.blLast && client.last.szProtocol == szProtocol && client.last.nRouterPort == nPort) {
         client.blLast = false;
         mapping = client.last;
-        return tavo::kRouterOk;
+        return tavo::kWireOk;
     }
     return client.pIgd->Get(szProtocol, nPort, mapping);
 }
@@ -86,8 +86,8 @@ void Fill(char (&szField)[N], const std::string& szText) {
 }
 
 // The router's answer as the caller gets it: its own code, or -1 when there was none.
-int Answer(int nCode, const tavo::RouterMapping& mapping, TAVO_UPNP_PORT_MAPPING* pMapping) {
-    if (nCode != tavo::kRouterOk) {
+int Answer(int nCode, const tavo::IgdEntry& mapping, TAVO_UPNP_PORT_MAPPING* pMapping) {
+    if (nCode != tavo::kWireOk) {
         return nCode < 0 ? Fail(TLIBC_ERR_READ, __LINE__) : nCode;
     }
     *pMapping = {};
@@ -142,7 +142,7 @@ int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
         if (pClient == nullptr || pMapping == nullptr || nIndex < 0) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        tavo::RouterMapping mapping;
+        tavo::IgdEntry mapping;
         const int nCode = ReadEntry(*pClient, nIndex, mapping);
         return Answer(nCode, mapping, pMapping);
     });
@@ -156,7 +156,7 @@ int TAVOUpnpPortMappingFind(int nExternalPort, const char* szProtocol, TAVO_UPNP
             (szWanted != "TCP" && szWanted != "UDP")) {
             return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
         }
-        tavo::RouterMapping mapping;
+        tavo::IgdEntry mapping;
         const int nCode = FindEntry(*pClient, szWanted, static_cast<uint16_t>(nExternalPort), mapping);
         return Answer(nCode, mapping, pMapping);
     });

@@ -10,6 +10,7 @@
 #include <memory>
 
 #include "ground/Border.h"
+#include "ground/Marks.h"
 #include "ground/TextFile.h"
 #include "porttest/PortTest.h"
 #include "tavo/log.h"
@@ -53,8 +54,11 @@ public:
     // False: the router does not tell any more.
     bool Shows(const TestRule& rule, bool& blShown) {
         while (mPIgd != nullptr && mNSilent < kSilentAnswers && Clock::now() < mEnd) {
-            const int nCode = tavo::ShowsRule(*mPIgd, rule, mSzBox, blShown);
-            if (nCode >= 0) {
+            tavo::IgdEntry entry;
+            const int nCode = mPIgd->Get("TCP", rule.nRouterPort, entry);
+            if (nCode >= 0) {  // whatever code it gives for an entry, it does not show one
+                blShown = nCode == tavo::kWireOk && entry.szClient == mSzBox && entry.nBoxPort == rule.nBoxPort &&
+                          entry.blEnabled;
                 mNSilent = 0;
                 return true;
             }
@@ -64,8 +68,8 @@ public:
     }
     // How many mappings upnpd has at the router for the box; below 0: it cannot be told.
     int CountOwn() {
-        std::vector<tavo::RouterMapping> rgTable;
-        if (mPIgd == nullptr || mPIgd->List(rgTable) != tavo::kRouterOk) {
+        std::vector<tavo::IgdEntry> rgTable;
+        if (mPIgd == nullptr || mPIgd->List(rgTable) != tavo::kWireOk) {
             return -1;
         }
         return static_cast<int>(std::count_if(rgTable.begin(), rgTable.end(), [this](const auto& entry) {

@@ -1,0 +1,594 @@
+// The mapping core and the test mappings against a router in memory.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <map>
+#include <set>
+#include <tuple>
+
+#include "mapping/Carry.h"
+#include "programs/common/IgdRouter.h"
+#include "programs/common/MadeFile.h"
+#include "programs/upnpd/TestMappings.h"
+
+namespace {
+
+using tavo::IgdReply;
+using tavo::RouterMapping;
+using tavo::RouterReply;
+
+// A table in memory that answers as a UPnP router does. One that says no shows nothing.
+class MemoryRouter : public tavo::Router {
+public:
+    tavo::Abilities What() const override { return {true, false, false, "718"}; }
+    RouterReply List(std::vector<RouterMapping>& rgMappings) override {
+        ++mNCalls;
+        for (const auto& [key, mapping] : mMapTable) {
+            if (!mBlListNothing && (mNListCode == tavo::kWireOk || mNListCode == tavo::kWireTooLong)) {
+                rgMappings.push_back(mapping);
+            }
+        }
+        return IgdReply(mNListCode);
+    }
+    RouterReply ListRange(const std::string&, uint16_t nFirst, uint16_t nLast,
+                          std::vector<RouterMapping>& rgMappings) override {
+        ++mNCalls;
+        for (const auto& [key, mapping] : mMapTable) {
+            if (mNRangeCode == tavo::kWireOk && key.second >= nFirst && key.second <= nLast && key.second != mNHidden) {
+                rgMappings.push_back(mapping);
+            }
+        }
+        return IgdReply(mNRangeCode);
+    }
+    RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+        ++mNCalls;
+        const auto it = mMapTable.find({szProtocol, nPort});
+        if (mNGetCode != tavo::kWireOk || it == mMapTable.end()) {
+            return IgdReply(mNGetCode != tavo::kWireOk ? mNGetCode : int{tavo::kIgdNoSuchEntry});
+        }
+        mapping = it->second;
+        return {};
+    }
+    RouterReply Add(RouterMapping& mapping) override {
+        ++mNCalls;
+        if (mapping.nRouterPort == mNSwallowed || mNAddCode != tavo::kWireOk) {
+            return IgdReply(mNAddCode);
+        }
+        Put(mapping).szDescription = mSzRewritten.empty() ? mapping.szDescription : mSzRewritten;
+        return {};
+    }
+    RouterReply Remove(const RouterMapping& mapping) override {
+        ++mNCalls;
+        if (mNRemoveCode != tavo::kWireOk) {
+            return IgdReply(mNRemoveCode);
+        }
+        return IgdReply(mMapTable.erase(tavo::KeyOf(mapping)) == 1 ? int{tavo::kWireOk} : int{tavo::kIgdNoSuchEntry});
+    }
+
+    RouterMapping& Put(const RouterMapping& mapping) { return mMapTable[tavo::KeyOf(mapping)] = mapping; }
+
+    std::map<std::pair<std::string, uint16_t>, RouterMapping> mMapTable;
+    int mNListCode = tavo::kWireOk;
+    bool mBlListNothing = false;  // with mNListCode
+    int mNGetCode = tavo::kWireOk;
+    int mNAddCode = tavo::kWireOk;
+    std::string mSzRewritten;  // what every description becomes
+    int mNRangeCode = tavo::kIgdInvalidAction;
+    int mNRemoveCode = tavo::kWireOk;
+    int mNHidden = 0;     // not shown in a range
+    int mNSwallowed = 0;  // promised and not kept
+    int mNCalls = 0;
+};
+
+constexpr char kBox[] = "192.168.1.5";
+
+RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, const char* szText) {
+    return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
+}
+
+// Each outcome in one text: its name, its word, whose doing it is, and what else is known of it.
+std::vector<std::string> Texts(const tavo::PassResult& result) {
+    std::vector<std::string> rgTexts;
+    for (const tavo::Outcome& outcome : result.rgOutcomes) {
+        const tavo::Verdict& verdict = outcome.verdict;
+        rgTexts.push_back(
+            outcome.szName + " " + verdict.szWord +
+            (verdict.holder ? " " + verdict.holder->szAddress + " " + verdict.holder->szDescription : "") +
+            (verdict.blOthers ? " others" : "") + (verdict.blAnew ? " anew" : "") +
+            (outcome.blLeftOver ? " left over" : ""));
+    }
+    return rgTexts;
+}
+
+// The core with a memory of its own, at a time that only the test moves.
+struct Core {
+    tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted) {
+        record.TurnTo({"192.168.1.1", ""});
+        return tavo::BringInLine(router, rgWanted, record, habit,
+                                 {kBox, [this] { return nNow; }, [] { return false; }, [this] { ++nSaves; }});
+    }
+    tavo::Record record{"", "boot"};
+    tavo::Habits habit;
+    int64_t nNow = 1000;
+    int nSaves = 0;
+};
+
+TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
+    MemoryRouter router;
+    for (const RouterMapping& mapping :
+         {Entry(1, 1, kBox, "tavo:a"), Entry(2, 2, kBox, "tavo:gone"), Entry(3, 9, kBox, "tavo:moved"),
+          Entry(4, 4, "192.168.1.9", "tavo:theirs"), Entry(5, 5, kBox, "game"), Entry(6, 9, kBox, "game")}) {
+        router.Put(mapping);
+    }
+    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a"), Entry(3, 3, "", "tavo:moved"),
+                                                 Entry(4, 4, "", "tavo:d"), Entry(5, 5, "", "tavo:e"),
+                                                 Entry(6, 6, "", "tavo:f"), Entry(7, 7, "", "tavo:g")};
+    Core core;
+    const auto result = core.Run(router, rgWanted);
+    std::vector<std::string> rgExpected = {"1/tcp 1",
+                                           "3/tcp 1 anew",
+                                           "4/tcp 718 192.168.1.9 tavo:theirs",
+                                           "5/tcp 1 others",
+                                           "6/tcp 718 192.168.1.5 game others",
+                                           "7/tcp 1 anew"};
+    EXPECT_EQ(Texts(result), rgExpected);
+    EXPECT_EQ(router.mMapTable.size(), 6U);
+    EXPECT_EQ(router.mMapTable.count({"TCP", 2}), 0U);
+    EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
+    EXPECT_EQ((router.mMapTable[{"TCP", 6}].nBoxPort), 9);
+    EXPECT_EQ((router.mMapTable[{"TCP", 4}].szClient), "192.168.1.9");
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease) << "of an age that nobody knows: renewed";
+    EXPECT_EQ(result.nNextSeconds, 100) << "the other program's lease ends before half of ours is over";
+
+    router.mNCalls = 0;
+    rgExpected[1] = "3/tcp 1";
+    rgExpected[5] = "7/tcp 1";
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), rgExpected);
+    EXPECT_EQ(router.mNCalls, 1);
+    router.mMapTable[{"TCP", 1}].nLease = 7;  // what is left, as some show it
+    core.nNow += core.habit.nLease / 2 - 1;
+    core.Run(router, rgWanted);
+    EXPECT_EQ(router.mNCalls, 2) << "not yet";
+    core.nNow += 1;
+    core.Run(router, rgWanted);
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease);
+    EXPECT_EQ((router.mMapTable[{"TCP", 5}].szDescription), "game");
+}
+
+TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
+    std::vector<RouterMapping> rgWanted;
+    for (uint16_t nPort = 1; nPort <= 10; ++nPort) {
+        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+    }
+    // What the range answers, what it hides, what the router swallows: the calls for a listing, ten looks, ten
+    // mappings and their proof, and the status of the fifth.
+    const std::tuple<int, int, int, int, const char*> rgCases[] = {
+        {tavo::kWireOk, 0, 0, 1 + 10 + 10 + 1, "1"},
+        {tavo::kWireOk, 5, 0, 1 + 10 + 10 + 1 + 1, "1"},
+        {tavo::kWireOk, 0, 5, 1 + 10 + 10 + 1 + 1, "lost"},
+        {tavo::kIgdInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 10, "lost"},
+        {tavo::kWireTimeout, 0, 0, 1 + 10 + 10 + 1 + 10, "1"}};
+    for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] : rgCases) {
+        MemoryRouter router;
+        router.mNRangeCode = nCode;
+        router.mNHidden = nHidden;
+        router.mNSwallowed = nSwallowed;
+        const auto result = Core().Run(router, rgWanted);
+        EXPECT_EQ(router.mNCalls, nCalls);
+        ASSERT_EQ(result.rgOutcomes.size(), 10U);
+        EXPECT_EQ(result.rgOutcomes[4].verdict.szWord, szFifth);
+        EXPECT_EQ(std::count_if(result.rgOutcomes.begin(), result.rgOutcomes.end(),
+                                [](const tavo::Outcome& outcome) { return outcome.verdict.szWord == "1"; }),
+                  nSwallowed == 0 ? 10 : 9);
+    }
+}
+
+TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
+    MemoryRouter router;
+    router.Put(Entry(1, 1, kBox, "tavo:old"));
+    router.Put(Entry(2, 9, kBox, "tavo:moved"));
+    router.mNRemoveCode = 606;
+    EXPECT_EQ(Texts(Core().Run(router, {})), (std::vector<std::string>{"1/tcp 606 left over", "2/tcp 606 left over"}));
+}
+
+// Where the whole table cannot be read, our own places are asked for; where nothing makes sense, nothing is said of
+// them.
+TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
+    for (const int nListCode : {static_cast<int>(tavo::kWireTooLong), static_cast<int>(tavo::kWireTimeout), 401}) {
+        MemoryRouter router;
+        Core core;
+        router.mNListCode = nListCode;
+        router.mBlListNothing = true;
+        router.mSzRewritten = "upnp";
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")})),
+                  (std::vector<std::string>{"1/tcp 1 anew", "2/tcp 1 anew"}));
+        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
+        EXPECT_EQ(router.mMapTable.size(), 1U);
+        router.mMapTable[{"TCP", 2}].szClient = "192.168.1.9";
+        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+        EXPECT_EQ(router.mMapTable.size(), 1U) << "another host has it by now";
+        EXPECT_TRUE(core.record.Here().empty());
+    }
+}
+
+TEST(Mapping, AFormerAddressIsTakenAwayFirstOrWaitedFor) {
+    for (const bool blRefuses : {false, true}) {
+        MemoryRouter router;
+        Core core;
+        router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
+        core.record.TurnTo({"192.168.1.1", ""});
+        core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow};
+        router.mNRemoveCode = blRefuses ? 606 : tavo::kWireOk;
+        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        EXPECT_EQ(Texts(result), std::vector<std::string>{blRefuses ? "1/tcp 606" : "1/tcp 1 anew"});
+        EXPECT_EQ((router.mMapTable[{"TCP", 1}].szClient), blRefuses ? "192.168.1.4" : kBox);
+        if (blRefuses) {
+            EXPECT_EQ(result.rgOutcomes[0].verdict.enState, tavo::PortState::kWaiting);
+            EXPECT_EQ(result.rgOutcomes[0].verdict.nLease, 3600U);
+            EXPECT_EQ(result.nNextSeconds, 3601);
+            router.mMapTable.clear();  // its lease has ended
+            EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
+        }
+    }
+}
+
+TEST(Mapping, CodesAndNothingButCodesAreNoRouterThatServes) {
+    MemoryRouter router;
+    router.mNListCode = 501;
+    router.mBlListNothing = true;
+    router.mNGetCode = 501;
+    router.mNAddCode = 501;
+    Core core;
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow};
+    router.mNRemoveCode = 501;
+    const auto result = core.Run(router, {});
+    EXPECT_EQ(result.transport.enReply, tavo::Reply::kGarbage);
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 501 left over"});
+}
+
+// Whoever takes an entry away while the table is read moves those that follow: some are not shown.
+TEST(Mapping, WhatAListingLeavesOutMayBeThere) {
+    MemoryRouter router;
+    Core core;
+    router.mSzRewritten = "upnp";
+    core.Run(router, {Entry(1, 1, "", "tavo:a")});
+    router.mMapTable[{"TCP", 2}] = Entry(2, 9, kBox, "upnp");  // another program's
+    router.mBlListNothing = true;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})),
+              std::vector<std::string>{"2/tcp 718 192.168.1.5 upnp others"});
+    EXPECT_FALSE(router.mMapTable.contains({"TCP", 1})) << "known, and taken away";
+    EXPECT_EQ((router.mMapTable[{"TCP", 2}].nBoxPort), 9);
+}
+
+TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
+    class Stubborn : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            return mMapTable.contains(tavo::KeyOf(mapping)) ? RouterReply() : MemoryRouter::Add(mapping);
+        }
+    };
+    for (const char* szText : {"", "upnp"}) {
+        Stubborn router;
+        Core core;
+        router.mSzRewritten = szText;
+        core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 2, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
+        EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 2);
+        core.Run(router, {});
+        EXPECT_TRUE(router.mMapTable.empty());
+    }
+}
+
+// The change was asked for, the process died, the router restarted, and another program has the place.
+TEST(Mapping, ATextThatTheRouterGivesToEverybodysProvesNothing) {
+    MemoryRouter router;
+    Core core;
+    router.mSzRewritten = "upnp";
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {kBox, 1, "upnp", false, 3600, core.nNow};
+    router.mMapTable[{"TCP", 1}] = Entry(1, 9, kBox, "upnp");
+    EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+    EXPECT_EQ(router.mMapTable.size(), 1U);
+}
+
+TEST(Mapping, AStopInTheMiddleLosesNothing) {
+    MemoryRouter router;
+    tavo::Record record("", "boot");
+    tavo::Habits habit;
+    record.TurnTo({"192.168.1.1", ""});
+    const auto result =
+        tavo::BringInLine(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
+                          {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] {}});
+    EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
+    EXPECT_TRUE(record.Here().contains({"TCP", 1}));
+}
+
+// A port whose answer was lost does not wait for the next check, which may be an hour away.
+TEST(Mapping, AnAnswerThatIsLostIsAskedForAgainSoon) {
+    class Lossy : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            MemoryRouter::Add(mapping);
+            return IgdReply(tavo::kWireTimeout);
+        }
+    };
+    Lossy router;
+    const auto result = Core().Run(router, {Entry(1, 1, "", "tavo:a")});
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp timeout"});
+    EXPECT_TRUE(result.transport.IsOk());
+    EXPECT_EQ(result.nNextSeconds, 10);
+}
+
+// One that keeps a mapping beyond its lease is not asked about it every few seconds for ever.
+TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
+    MemoryRouter router;
+    Core core;
+    core.nNow = 10000;
+    router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
+    router.mNRemoveCode = 606;
+    core.record.TurnTo({"192.168.1.1", ""});
+    core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - 7200};
+    const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 606"});
+    EXPECT_EQ(std::make_pair(result.nNextSeconds, result.rgOutcomes[0].verdict.nLease), std::make_pair(0, 0U));
+}
+
+// Where nothing can be seen, what is taken away blindly is only what must still be ours.
+TEST(Mapping, ABlindRemovalEndsWithTheLease) {
+    for (const int nAge : {3600, 3661}) {
+        MemoryRouter router;
+        Core core;
+        router.mBlListNothing = true;
+        router.mNListCode = 401;
+        router.mNGetCode = 401;
+        router.mMapTable[{"TCP", 1}] = Entry(1, 1, "192.168.1.9", "theirs");
+        core.nNow = 10000;
+        core.record.TurnTo({"192.168.1.1", ""});
+        core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow - nAge};
+        core.Run(router, {});
+        EXPECT_EQ(router.mMapTable.size(), nAge == 3600 ? 0U : 1U);
+        EXPECT_TRUE(core.record.Here().empty());
+    }
+}
+
+TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    record.Here()[{"TCP", 1}] = {kBox, 11, "\"odd\n]text", true, 100, 5000};
+    record.TurnTo({"192.168.1.1", "cc:dd"});
+    EXPECT_TRUE(record.Here().empty()) << "another device at the same address";
+    record.Here()[{"UDP", 2}] = {kBox, 2, "tavo:b", true, 0, 5000};
+    const std::string szText = record.Text();
+
+    tavo::Record same(szText, "one");
+    same.TurnTo({"10.0.0.1", "aa:bb"});  // the same device has another address
+    ASSERT_EQ(same.Here().size(), 1U);
+    tavo::Made& made = same.Here()[{"TCP", 1}];
+    EXPECT_EQ(made.szText, "\"odd\n]text");
+    for (const bool blShown : {true, false}) {  // until it is shown, what it leads to will do, or our mark
+        made.blShown = blShown;
+        EXPECT_TRUE(made.IsEntry(Entry(1, 11, kBox, "\"odd\n]text")));
+        EXPECT_EQ(made.IsEntry(Entry(1, 11, kBox, "any")), !blShown);
+        EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "\"odd\n]text"))) << "the router may give it to everybody's";
+        EXPECT_FALSE(made.IsEntry(Entry(1, 12, kBox, "any")));
+        EXPECT_FALSE(made.IsEntry(Entry(1, 11, "192.168.1.9", "\"odd\n]text")));
+    }
+    made.szText = "tavo:a";
+    EXPECT_TRUE(made.IsEntry(Entry(1, 12, kBox, "tavo:a")));
+    EXPECT_EQ(std::make_tuple(made.IsDue(5049), made.IsDue(5050), made.End()), std::make_tuple(false, true, 5100));
+
+    tavo::Record later(szText, "two");
+    later.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_TRUE((later.Here()[{"TCP", 1}].IsDue(0)));
+    later.TurnTo({"10.9.9.9", "ee:ff"});
+    later.Prune(100 + 60);
+    EXPECT_EQ(tavo::Record(later.Text(), "two").Text(), later.Text());
+    later.Prune(100 + 61);
+    later.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_TRUE(later.Here().empty()) << "its lease has surely ended, whenever it was asked for";
+    later.TurnTo({"192.168.1.1", "cc:dd"});
+    EXPECT_EQ(later.Here().size(), 1U) << "this one never ends";
+    EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
+}
+
+TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    for (const uint16_t nPort : {uint16_t{1}, uint16_t{2}, uint16_t{3}}) {
+        record.Here()[{"TCP", nPort}] = {kBox, nPort, "tavo:a", true, 100, 5000};
+    }
+    const std::string szText = record.Text();
+    // What of the second row is written over.
+    for (const char* szDamaged : {"[192.168.1.1 TCP 2]", "router_port=\"2\"", "protocol=\"TCP\"\nrouter_port=\"2\""}) {
+        std::string szBad = szText;
+        szBad.replace(szText.find(szDamaged), 8, std::string("\0\xff\x1b\"=[\\q", 8));
+        tavo::Record damaged(szBad, "one");
+        damaged.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_EQ(damaged.Here().size(), 2U) << szDamaged;
+        EXPECT_TRUE((damaged.Here().contains({"TCP", 1}) && damaged.Here().contains({"TCP", 3}))) << szDamaged;
+    }
+    for (const char* szAsked : {"-9223372036854775808", "9223372036854775807", "99999999999999999999"}) {
+        std::string szBad = szText;
+        szBad.replace(szText.find("5000"), 4, szAsked);
+        tavo::Record odd(szBad, "one");
+        odd.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_TRUE((odd.Here()[{"TCP", 1}].IsDue(6000))) << szAsked;
+    }
+}
+
+TEST(Record, KeepsWhatMayHaveNoLease) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", false, 100, 5000};
+    record.TurnTo({"192.168.1.1", "cc:dd"});
+    record.Prune(5000 + 100 + 30 * 24 * 60 * 60);
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_EQ(record.Here().size(), 1U);
+}
+
+// Every port of both protocols, with texts as long as a router may show them.
+TEST(Record, OfEveryPortIsReadBack) {
+    constexpr char kFile[] = "/var/lib/tavo/every_port.conf";
+    {
+        tavo::MadeFile file(kFile);
+        file.Get().TurnTo({"192.168.100.100", "aa:bb:cc:dd:ee:ff"});
+        for (int i = 1; i <= 65535; ++i) {
+            for (const char* szProtocol : {"TCP", "UDP"}) {
+                const auto nPort = static_cast<uint16_t>(i);
+                file.Get().Here()[{szProtocol, nPort}] = {kBox, nPort, std::string(256, 'x'), true, 3600, 5000};
+            }
+        }
+        file.Save();
+    }
+    tavo::MadeFile again(kFile);
+    again.Get().TurnTo({"192.168.100.100", "aa:bb:cc:dd:ee:ff"});
+    EXPECT_EQ(again.Get().Here().size(), 2U * 65535U);
+    std::remove(kFile);
+}
+
+// The neighbour's hardware is not always known. A pass without it must not make one router's rows another one's.
+TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
+    tavo::Record record("", "one");
+    for (const char* szHardware : {"aa:bb", "cc:dd"}) {
+        record.TurnTo({"192.168.1.1", szHardware});
+        record.Here()[{"TCP", 1}] = {kBox, 1, szHardware, true, 0, 5000};
+    }
+    record.TurnTo({"192.168.1.1", ""});
+    const std::string szFirst = record.Here()[{"TCP", 1}].szText;
+    for (int i = 0; i < 3; ++i) {
+        const std::string szText = record.Text();
+        record.TurnTo({"192.168.1.1", ""});
+        EXPECT_EQ((record.Here()[{"TCP", 1}].szText), szFirst) << "the same at each pass";
+        EXPECT_EQ(record.Text(), szText);
+    }
+    for (const char* szHardware : {"aa:bb", "cc:dd", "aa:bb"}) {
+        record.TurnTo({"192.168.1.1", szHardware});
+        ASSERT_EQ(record.Here().size(), 1U);
+        EXPECT_EQ((record.Here()[{"TCP", 1}].szText), szHardware);
+    }
+}
+
+// A router under test: some ports conflict, and some answers are lost after the work was done.
+class OddRouter : public MemoryRouter {
+public:
+    RouterReply Add(RouterMapping& mapping) override {
+        if (mSetConflicts.contains(mapping.nRouterPort)) {
+            return IgdReply(tavo::kIgdConflict);
+        }
+        for (const auto& [key, entry] : mMapTable) {  // as strict as any: no two lead to one port of the box
+            if (key.second != mapping.nRouterPort && entry.nBoxPort == mapping.nBoxPort && entry.szClient == kBox) {
+                return IgdReply(501);
+            }
+        }
+        return Lose(MemoryRouter::Add(mapping));
+    }
+    RouterReply Remove(const RouterMapping& mapping) override { return Lose(MemoryRouter::Remove(mapping)); }
+    RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+        return Lose(MemoryRouter::Get(szProtocol, nPort, mapping));
+    }
+    std::set<uint16_t> mSetConflicts;
+    int mNLoseEvery = 0;
+    bool mBlSilent = false;
+
+private:
+    RouterReply Lose(RouterReply reply) {
+        const bool blLost = mBlSilent || (mNLoseEvery != 0 && ++mNAnswers % mNLoseEvery == 0);
+        return blLost ? IgdReply(tavo::kWireTimeout) : reply;
+    }
+    int mNAnswers = 0;
+};
+
+std::vector<tavo::TestRule> TestRules(uint16_t nFirst, int nRules) {
+    std::vector<tavo::TestRule> rgRules;
+    for (int i = 0; i < nRules; ++i) {
+        rgRules.push_back({static_cast<uint16_t>(nFirst + i), static_cast<uint16_t>(nFirst + i), false, ""});
+    }
+    return rgRules;
+}
+
+std::vector<int> Ports(const OddRouter& router, const char* szPrefix) {
+    std::vector<int> rgPorts;
+    for (const auto& [key, mapping] : router.mMapTable) {
+        if (mapping.szDescription.starts_with(szPrefix)) {
+            rgPorts.push_back(key.second * 100 + mapping.nBoxPort);
+        }
+    }
+    return rgPorts;
+}
+
+const auto kGoOn = [] { return false; };
+
+TEST(TestMappings, TakeOnlyWhatNobodyHasAndLeaveTheTableAsItWas) {
+    for (const int nListCode : {static_cast<int>(tavo::kWireOk), 401}) {
+        for (const int nLoseEvery : {0, 3}) {
+            SCOPED_TRACE(nListCode + nLoseEvery);
+            OddRouter router;
+            for (const RouterMapping& mapping :
+                 {Entry(11, 1, kBox, "tavo:rule"), Entry(12, 12, "192.168.1.9", "tavotest:12"),
+                  Entry(13, 3, kBox, "game")}) {
+                router.mMapTable[{"TCP", mapping.nRouterPort}] = mapping;
+            }
+            const auto mapBefore = router.mMapTable;
+            router.mSetConflicts = {15};
+            router.mNListCode = nListCode;
+            router.mNLoseEvery = nLoseEvery;
+            if (nListCode == tavo::kWireOk) {
+                router.mMapTable[{"TCP", 40}] = Entry(40, 40, kBox, "tavotest:40");  // of one that was killed
+            }
+            tavo::TestMappings test(router, kBox, TestRules(10, 4), [](uint16_t nPort) { return nPort != 16; });
+            EXPECT_TRUE(test.Add(kGoOn));
+            const auto rgMade = Ports(router, "tavotest:");
+            const std::vector<int> rgWanted = {1010, 1212, 1414, 1717, 1818};
+            if (nListCode == tavo::kWireOk) {
+                EXPECT_EQ(rgMade, rgWanted);
+            }
+            EXPECT_TRUE(test.Readd(kGoOn));
+            EXPECT_TRUE(test.Change(kGoOn));
+            if (nListCode == tavo::kWireOk) {
+                EXPECT_EQ(Ports(router, "tavotest:"), (std::vector<int>{1014, 1212, 1417, 1718, 1810}));
+            }
+            EXPECT_TRUE(test.Remove(kGoOn));
+            EXPECT_EQ(Ports(router, ""), [&] {
+                OddRouter before;
+                before.mMapTable = mapBefore;
+                return Ports(before, "");
+            }());
+        }
+    }
+}
+
+TEST(TestMappings, NeverTouchAPortThatBecameAnotherHosts) {
+    OddRouter router;
+    tavo::TestMappings test(router, kBox, TestRules(10, 3), [](uint16_t) { return true; });
+    ASSERT_TRUE(test.Add(kGoOn));
+    router.mMapTable[{"TCP", 11}].szClient = "192.168.1.9";  // the router restarted, and another host was faster
+    EXPECT_TRUE(test.Remove(kGoOn));
+    EXPECT_EQ(Ports(router, ""), std::vector<int>{1111});
+}
+
+TEST(TestMappings, ARouterThatFallsSilentFailsSoon) {
+    for (bool (tavo::TestMappings::*pfnStep)(const std::function<bool()>&) :
+         {&tavo::TestMappings::Add, &tavo::TestMappings::Readd, &tavo::TestMappings::Change,
+          &tavo::TestMappings::Remove}) {
+        OddRouter router;
+        tavo::TestMappings test(router, kBox, TestRules(10, 60), [](uint16_t) { return true; });
+        ASSERT_TRUE(test.Add(kGoOn));
+        router.mBlSilent = true;
+        router.mNListCode = tavo::kWireTimeout;
+        router.mNCalls = 0;
+        EXPECT_FALSE((test.*pfnStep)(kGoOn));
+        EXPECT_LE(router.mNCalls, 4);
+    }
+}
+
+TEST(TestMappings, OneThatIsKeptIsChangedToo) {
+    OddRouter router;
+    tavo::TestMappings test(router, kBox, TestRules(10, 1), [](uint16_t) { return true; });
+    ASSERT_TRUE(test.Add(kGoOn));
+    EXPECT_TRUE(test.Change(kGoOn));
+    EXPECT_EQ(Ports(router, ""), std::vector<int>{1011});
+}
+
+}  // namespace
