@@ -21,6 +21,7 @@
 #include <string_view>
 #include <utility>
 
+#include "ground/BootTimer.h"
 #include "ground/Descriptor.h"
 #include "ground/OwnFile.h"
 #include "ground/Paths.h"
@@ -36,7 +37,7 @@ namespace tavo {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using Clock = BootClock;
 
 constexpr char kHelp[] =
     "Usage: %s [--foreground [--take-over] | --stop | --hand-over | --make-locks]\n"
@@ -67,6 +68,7 @@ constexpr auto kSettle = std::chrono::seconds(1);      // an address rarely chan
 constexpr auto kLeastPause = std::chrono::seconds(5);  // between passes that others than we can cause
 constexpr auto kStartLimit = std::chrono::seconds(5);  // of an instance that somebody else starts
 constexpr int kPollMilliseconds = 20;
+constexpr int kWaitMilliseconds = 3600 * 1000;  // the timer comes before
 
 // Writes our pid where the library looks for it; it deletes the file before it starts a daemon.
 void WritePidFile(const DaemonNames& names) {
@@ -184,6 +186,7 @@ private:
     SignalQueue mSignals;
     Descriptor mFdEvents;
     NetworkWatch mNetwork;
+    BootTimer mTimer;
     bool mBlRequested = true;  // the start counts as a request
     int mNCut = 0;             // passes in a row that a newer request may have ended early
     Clock::time_point mNext = Clock::now();
@@ -193,13 +196,14 @@ private:
 
 // Until the clock, a signal, a new file in the marker's directory or a word from the router.
 void Frame::Wait() {
-    const auto nLeft = std::chrono::duration_cast<std::chrono::milliseconds>(mNext - Clock::now()).count() + 1;
-    std::vector<pollfd> rgWaiting = {mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mNetwork.Fd(), POLLIN, 0}};
+    mTimer.Set(mNext);
+    std::vector<pollfd> rgWaiting = {
+        mSignals.Waiting(), {mFdEvents.Get(), POLLIN, 0}, {mNetwork.Fd(), POLLIN, 0}, {mTimer.Fd(), POLLIN, 0}};
     const auto nOurs = static_cast<std::ptrdiff_t>(rgWaiting.size());
     for (const int fd : mMapper.WakeFds()) {
         rgWaiting.push_back({fd, POLLIN, 0});
     }
-    mSignals.Wait(rgWaiting, static_cast<int>(std::clamp<int64_t>(nLeft, 0, 3600 * 1000)));
+    mSignals.Wait(rgWaiting, kWaitMilliseconds);
     alignas(inotify_event) char szEvents[4096];
     while (read(mFdEvents.Get(), szEvents, sizeof(szEvents)) > 0) {
     }

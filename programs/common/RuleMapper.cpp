@@ -21,8 +21,7 @@ namespace tavo {
 namespace {
 
 constexpr mode_t kResultMode = 0644;
-constexpr int kFailuresToRediscover = 3;
-constexpr int kRetrySeconds = 10;
+constexpr int kRetrySeconds = 10;  // until a run key that could not be mended is tried again
 constexpr int kWithdrawTries = 3;
 constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
 constexpr size_t kAddressSize = 16;
@@ -167,26 +166,24 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
             mTurn.GiveBack();
         }
     }
-    const int nSeconds = SecondsToNext(result);
+    const int nSeconds = SecondsToNext(result, blRequested);
     if (!result.blStopped) {
         PublishPass(std::move(result), blRequested, nSeconds, fnStop);
     }
     return nSeconds;
 }
 
-int RuleMapper::SecondsToNext(const PassResult& result) {
-    if (!result.transport.IsOk()) {
-        if (++mNFailures >= kFailuresToRediscover) {
-            mNFailures = 0;
-            LostRouter();
-        }
-        return std::min(mNCheckSeconds, kRetrySeconds);
+int RuleMapper::SecondsToNext(const PassResult& result, bool blRequested) {
+    std::string szNow;
+    for (const Outcome& outcome : result.rgOutcomes) {
+        szNow += outcome.szName + "=" + outcome.verdict.szWord + (outcome.verdict.blAnew ? " anew\n" : "\n");
     }
-    mNFailures = 0;
-    if (!mBlMended) {
-        return std::min(mNCheckSeconds, kRetrySeconds);
+    const bool blChange = std::exchange(mSzLast, std::move(szNow)) != mSzLast || blRequested;
+    const NextLook next = mKeeper.After(result, blChange, mNCheckSeconds);
+    if (next.blLost) {
+        LostRouter();
     }
-    return result.nNextSeconds > 0 ? std::min(mNCheckSeconds, result.nNextSeconds) : mNCheckSeconds;
+    return mBlMended ? next.nSeconds : std::min(next.nSeconds, kRetrySeconds);
 }
 
 // What the rules themselves say of the outcomes: whose they are, and what was not asked of the router at all.

@@ -13,6 +13,7 @@
 
 #include "ground/BootClock.h"
 #include "mapping/Carry.h"
+#include "mapping/Keeper.h"
 #include "mapping/Pass.h"
 #include "programs/common/Daemon.h"
 #include "programs/common/MadeFile.h"
@@ -69,7 +70,7 @@ private:
     PassResult Pass(bool blRequested, const std::function<bool()>& fnStop);
     void AddRules(OutcomeList& rgOutcomes) const;
     void WriteResults(const OutcomeList& rgOutcomes) const;
-    int SecondsToNext(const PassResult& result);
+    int SecondsToNext(const PassResult& result, bool blRequested);
     void LookAtRouter(Published& state, const std::function<bool()>& fnStop);
     void AskOutside(const std::function<bool()>& fnStop);
     void PublishPass(PassResult result, bool blRequested, int nSecondsToNext, const std::function<bool()>& fnStop);
@@ -86,7 +87,8 @@ private:
     RouterTurn mTurn;
     std::string mSzGateway;
     std::string mSzBox;
-    int mNFailures = 0;
+    Keeper mKeeper;
+    std::string mSzLast;  // what the last pass had to say
     std::string mSzOutside;
     int mNUntilOutside = 0;  // passes until the router is asked for it again
     ToldFile mTold;

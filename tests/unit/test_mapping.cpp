@@ -1,13 +1,18 @@
 // The mapping core and the test mappings against a router in memory.
 #include <gtest/gtest.h>
+#include <poll.h>
 
 #include <algorithm>
 #include <cstdio>
+#include <fstream>
+#include <iterator>
 #include <map>
 #include <set>
 #include <tuple>
 
+#include "ground/BootTimer.h"
 #include "mapping/Carry.h"
+#include "mapping/Keeper.h"
 #include "programs/common/IgdRouter.h"
 #include "programs/common/MadeFile.h"
 #include "programs/upnpd/TestMappings.h"
@@ -351,6 +356,51 @@ TEST(Mapping, ABlindRemovalEndsWithTheLease) {
         EXPECT_EQ(router.mMapTable.size(), nAge == 3600 ? 0U : 1U);
         EXPECT_TRUE(core.record.Here().empty());
     }
+}
+
+// Often after a change, seldom in peace; a router that fails is looked for anew at every third time.
+TEST(Keeper, LooksSoonAfterAChangeAndSeldomInPeace) {
+    struct Pass {
+        bool blFails;
+        bool blChange;
+        int nDue;  // of the pass itself
+        int nSeconds;
+        bool blLost;
+    };
+    const Pass rgPasses[] = {{false, true, 0, 10, false}, {false, false, 0, 20, false},  {false, false, 0, 40, false},
+                             {false, false, 7, 7, false}, {false, false, 0, 120, false}, {false, false, 0, 120, false},
+                             {true, false, 0, 10, false}, {true, false, 0, 10, false},   {true, false, 0, 10, true},
+                             {true, false, 0, 10, false}, {false, false, 0, 10, false},  {false, false, 500, 20, false},
+                             {true, false, 0, 10, false}, {true, false, 0, 10, false},   {false, true, 3, 3, false}};
+    tavo::Keeper keeper;
+    for (size_t i = 0; i < std::size(rgPasses); ++i) {
+        tavo::PassResult result;
+        result.transport = {rgPasses[i].blFails ? tavo::Reply::kTimeout : tavo::Reply::kOk};
+        result.nNextSeconds = rgPasses[i].nDue;
+        const tavo::NextLook next = keeper.After(result, rgPasses[i].blChange, 120);
+        EXPECT_EQ(std::pair(next.nSeconds, next.blLost), std::pair(rgPasses[i].nSeconds, rgPasses[i].blLost)) << i;
+    }
+    EXPECT_EQ(tavo::Keeper().After({}, true, 1).nSeconds, 1) << "never longer than the user wants it";
+}
+
+// A box that slept past the time looks at once, and not after the rest of a wait: the timer goes by the clock that goes
+// on in sleep.
+TEST(BootTimer, GoesByTheBootClock) {
+    tavo::BootTimer timer;
+    const auto fnReady = [&timer](int nMilliseconds) {
+        pollfd waiting{timer.Fd(), POLLIN, 0};
+        return poll(&waiting, 1, nMilliseconds) == 1;
+    };
+    timer.Set(tavo::BootClock::now() + std::chrono::hours(1));
+    EXPECT_FALSE(fnReady(0));
+    for (const auto time : {tavo::BootClock::now() - std::chrono::hours(1), tavo::BootClock::time_point(),
+                            tavo::BootClock::now() + std::chrono::milliseconds(5)}) {
+        timer.Set(time);
+        EXPECT_TRUE(fnReady(2000));
+    }
+    std::ifstream info("/proc/self/fdinfo/" + std::to_string(timer.Fd()));
+    const std::string szInfo((std::istreambuf_iterator<char>(info)), std::istreambuf_iterator<char>());
+    EXPECT_NE(szInfo.find("clockid: " + std::to_string(CLOCK_BOOTTIME)), std::string::npos) << szInfo;
 }
 
 TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
