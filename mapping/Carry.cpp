@@ -16,11 +16,13 @@ namespace tavo {
 namespace {
 
 constexpr int64_t kReadBackAfter = 20;  // seconds; a slow router's yes is not left open for longer
+constexpr int64_t kLookFor = 20;        // seconds; then what was looked at is done
 constexpr int kRangeFrom = 4;           // fewer are asked for one by one
 constexpr int kRangePorts = 64;         // of one request
 constexpr int kMostSteps = 4;           // about one place in one pass: look, take away, add, and one surprise
 constexpr size_t kTogether = 512;       // wanted places that are looked at before the first of them is written
 constexpr size_t kMostSaves = 8;        // of the record in one pass, however many they are
+constexpr char kGoesOn[] = "the router needs longer for so many ports; it is gone on with";
 constexpr char kWritten[] = "written";  // the router said yes, and has not shown it yet
 constexpr char kLost[] = "lost";        // the router said yes, and does not show it
 constexpr size_t kMaxDescription = 64;  // of somebody else's entry
@@ -63,12 +65,13 @@ private:
     void LookAtTable();
     RouterReply Look(const MappingKey& key, Place& place);
     void Recall();
-    void LookAt(const std::vector<MappingKey>& rgKeys);
+    void LookAt(std::vector<MappingKey>& rgKeys);
     void TakeAway(const std::vector<MappingKey>& rgKeys);
     bool Remove(const MappingKey& key, Place& place);
     bool Intend(const MappingKey& key, const Place& place);
     void NoteIntents(const std::vector<MappingKey>& rgKeys);
-    void Bring(const std::vector<MappingKey>& rgKeys);
+    size_t Clear(std::vector<MappingKey> rgKeys);
+    size_t Bring(std::vector<MappingKey> rgKeys);
     void Settle(const MappingKey& key, Place& place);
     bool Do(const MappingKey& key, Place& place, const Step& step);
     bool Renew(const MappingKey& key, Place& place);
@@ -85,6 +88,7 @@ private:
     Verdict StillHeld(const MappingKey& key, const RouterReply& reply);
     RouterMapping Known(const MappingKey& key, const Place& place);
     void Wake(int64_t nAt) { mNNext = std::min(mNNext, nAt); }
+    RouterReply Unasked() const;
     void Conclude(const std::vector<RouterMapping>& rgWanted);
 
     Router& mRouter;
@@ -178,13 +182,17 @@ RouterReply Pass::Look(const MappingKey& key, Place& place) {
     return reply;
 }
 
-void Pass::LookAt(const std::vector<MappingKey>& rgKeys) {
-    for (const MappingKey& key : rgKeys) {
-        Place& place = mMapPlaces[key];
-        if (!IsOver() && StepFor(key, place).enAction == Action::kLook) {
-            Look(key, place);
+// Drops those for which there was no time: a slow router's pass is for doing something, too.
+void Pass::LookAt(std::vector<MappingKey>& rgKeys) {
+    const int64_t nEnd = mAround.fnNow() + kLookFor;
+    size_t nLooked = 0;
+    for (; nLooked < rgKeys.size() && (nLooked == 0 || mAround.fnNow() <= nEnd); ++nLooked) {
+        Place& place = mMapPlaces[rgKeys[nLooked]];
+        if (!IsOver() && StepFor(rgKeys[nLooked], place).enAction == Action::kLook) {
+            Look(rgKeys[nLooked], place);
         }
     }
+    rgKeys.resize(nLooked);
 }
 
 // True when it is gone.
@@ -254,8 +262,16 @@ void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
     }
 }
 
-// Some of the wanted places, together: looking, saving and writing in turns would be slow.
-void Pass::Bring(const std::vector<MappingKey>& rgKeys) {
+// Some of the places that no rule asks for, as many as there is time to look at.
+size_t Pass::Clear(std::vector<MappingKey> rgKeys) {
+    LookAt(rgKeys);
+    TakeAway(rgKeys);
+    return rgKeys.size();
+}
+
+// Some of the places, together, as many as there is time to look at: looking, saving and writing in turns would be
+// slow.
+size_t Pass::Bring(std::vector<MappingKey> rgKeys) {
     LookAt(rgKeys);
     TakeAway(rgKeys);
     if (!IsOver()) {
@@ -267,6 +283,7 @@ void Pass::Bring(const std::vector<MappingKey>& rgKeys) {
             ReadBack();
         }
     }
+    return rgKeys.size();
 }
 
 void Pass::Settle(const MappingKey& key, Place& place) {
@@ -475,7 +492,7 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
     };
     RouterReply reply;
     if (!fnServes()) {
-        reply = IsOver() ? mResult.transport : Look(key, place);
+        reply = IsOver() ? Unasked() : Look(key, place);
     }
     place.blWritten = false;
     if (fnServes()) {
@@ -548,6 +565,12 @@ RouterMapping Pass::Known(const MappingKey& key, const Place& place) {
     return {key.first, key.second, pMade->nBoxPort, pMade->szClient, pMade->szText, nLeft, true};
 }
 
+// What there is to say of a place that the router was not asked about any more.
+RouterReply Pass::Unasked() const {
+    const bool blLate = mResult.transport.IsOk() && !mResult.blStopped;
+    return blLate ? RouterReply{Reply::kTimeout, "timeout"} : mResult.transport;
+}
+
 void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     const bool blAsked = !mMapPlaces.empty();
     if (blAsked && !mBlSense && mResult.transport.IsOk() && !mResult.blStopped) {
@@ -557,8 +580,10 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = mMapPlaces[KeyOf(wanted)];
         if (place.verdict.szWord.empty()) {
-            const bool blLost = mResult.transport.IsOk() && !mResult.blStopped;
-            place.verdict = Refusal(blLost ? RouterReply{Reply::kTimeout, "timeout"} : mResult.transport);
+            place.verdict = Refusal(Unasked());
+        }
+        if (mResult.blUnfinished && mResult.transport.IsOk() && place.verdict.enState == PortState::kUnknown) {
+            place.verdict.szWhy = kGoesOn;
         }
         if (place.verdict.enState == PortState::kUnknown) {
             Wake(mAround.fnNow() + kAskAgain);
@@ -572,7 +597,7 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
             continue;
         }
         const RouterMapping left = Known(key, place);
-        Outcome outcome = OutcomeOf(left, StillHeld(key, place.kept.IsOk() ? mResult.transport : place.kept));
+        Outcome outcome = OutcomeOf(left, StillHeld(key, place.kept.IsOk() ? Unasked() : place.kept));
         outcome.blLeftOver = true;
         outcome.verdict.nLease = blThere ? left.nLease : outcome.verdict.nLease;
         mResult.rgOutcomes.push_back(std::move(outcome));
@@ -600,17 +625,29 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
             rgUnwanted.push_back(key);
         }
     }
-    LookAt(rgUnwanted);
-    TakeAway(rgUnwanted);
+    for (size_t i = 0; i < rgUnwanted.size() && !IsOver();) {
+        i += Clear({rgUnwanted.begin() + static_cast<std::ptrdiff_t>(i), rgUnwanted.end()});
+    }
+    std::vector<MappingKey> rgKeys;
+    for (const RouterMapping& wanted : rgWanted) {
+        rgKeys.push_back(KeyOf(wanted));
+    }
+    if (const auto next = std::find(rgKeys.begin(), rgKeys.end(), mHabit.next); next != rgKeys.end()) {
+        std::rotate(rgKeys.begin(), next, rgKeys.end());
+    }
     const size_t nTogether = std::max(kTogether, rgWanted.size() / kMostSaves + 1);
-    for (size_t i = 0; i < rgWanted.size(); i += nTogether) {
-        std::vector<MappingKey> rgKeys;
-        for (size_t j = i; j < std::min(i + nTogether, rgWanted.size()); ++j) {
-            rgKeys.push_back(KeyOf(rgWanted[j]));
-        }
-        Bring(rgKeys);
+    for (size_t i = 0; i < rgKeys.size() && !IsOver();) {
+        const auto first = rgKeys.begin() + static_cast<std::ptrdiff_t>(i);
+        i += Bring({first, first + static_cast<std::ptrdiff_t>(std::min(nTogether, rgKeys.size() - i))});
     }
     ReadBack();
+    mHabit.next = {};
+    if (mResult.blUnfinished) {
+        const auto next = std::find_if(rgKeys.begin(), rgKeys.end(), [this](const MappingKey& key) {
+            return mMapPlaces[key].verdict.enState == PortState::kUnknown;
+        });
+        mHabit.next = next == rgKeys.end() ? MappingKey() : *next;
+    }
     Conclude(rgWanted);
     mAround.fnSave();
     return std::move(mResult);

@@ -24,6 +24,7 @@ struct Habits {
     // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
     // are not asked for again while they stand here.
     std::map<MappingKey, std::string> mapElsewhere = {};
+    MappingKey next = {};  // where to go on, after a pass that its time was too short for
 };
 
 // Asks for one mapping, with its client set and the lease that the router is known to take; mapping.nLease is what it

@@ -15,7 +15,8 @@ struct PassResult {
     OutcomeList rgOutcomes;  // those of the wanted mappings first, in their order
     RouterReply transport;   // not kOk: why the router could not be spoken to
     bool blStopped = false;
-    int nNextSeconds = 0;  // until something has to be done again; 0: nothing has to
+    bool blUnfinished = false;  // its time was up: the next one goes on where it ended
+    int nNextSeconds = 0;       // until something has to be done again; 0: nothing has to
     RouterState enRouter = RouterState::kNotAsked;
 };
 
@@ -26,10 +27,8 @@ public:
 
     bool IsOver() {
         mResult.blStopped = mResult.blStopped || mFnStop();
-        if (mFnNow() > mNEnd && mResult.transport.IsOk()) {
-            mResult.transport = {Reply::kTimeout, "timeout"};
-        }
-        return mResult.blStopped || !mResult.transport.IsOk();
+        mResult.blUnfinished = mResult.blUnfinished || mFnNow() > mNEnd;
+        return mResult.blStopped || mResult.blUnfinished || !mResult.transport.IsOk();
     }
     // Counts answers that did not come; after a few in a row the pass is over.
     RouterReply Note(RouterReply reply) {

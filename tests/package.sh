@@ -8,7 +8,11 @@ export SYSTEMD_OFFLINE=1
 rm -f /usr/sbin/policy-rc.d # which may forbid to start anything
 fail() { echo "FAILED: $1" && exit 1; }
 absent() { for szPath in "$@"; do [ ! -e "$szPath" ] || fail "$szPath is still there"; done; }
-install() { dpkg --force-depends -i $(printf '%s_*.deb ' "$@") >dpkg.log 2>&1 || { cat dpkg.log && fail "$* cannot be installed"; }; }
+install() {
+    local rgDebs=()
+    for szPackage in "$@"; do rgDebs+=("$szPackage"_*.deb); done
+    dpkg --force-depends -i "${rgDebs[@]}" >dpkg.log 2>&1 || { cat dpkg.log && fail "$* cannot be installed"; }
+}
 pid() { cat "/run/$1.pid" 2>/dev/null; }
 alive() { [ -n "$(pid "$1")" ] && kill -0 "$(pid "$1")"; }
 (umask 022 && cpack -G DEB --config "$1/CPackConfig.cmake" -B "$PWD" >cpack.log) || { cat cpack.log && exit 1; }
@@ -18,7 +22,7 @@ done
 
 # The port checker alone brings nothing else, and does not start by itself.
 install ./libtavoportmap0 ./tavoportcheckd
-[ "$(ls /usr/tavo/sbin /usr/tavo/bin 2>/dev/null | grep -c .)" -le 2 ] || fail "the port checker brings more than itself"
+[ "$(find /usr/tavo/sbin /usr/tavo/bin -mindepth 1 2>/dev/null | wc -l)" -le 2 ] || fail "the port checker brings more than itself"
 [ ! -L /etc/systemd/system/multi-user.target.wants/tavoportcheckd.service ] || fail "the port checker is enabled"
 [ "$(stat -c %a /etc/tavo/portcheck.conf)" = 600 ] || fail "others can read the port checker's token"
 dpkg -P tavoportcheckd >/dev/null

@@ -200,7 +200,8 @@ int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
     pMapping->nExternalPort = std::atoi(szItem.c_str() + 4);
     if (const size_t nHost = szItem.find('@'); nHost != std::string::npos) {
         const size_t nPort = szItem.find(':', nHost);
-        szItem.substr(nHost + 1, nPort - nHost - 1).copy(pMapping->szInternalClient, sizeof(pMapping->szInternalClient) - 1);
+        szItem.substr(nHost + 1, nPort - nHost - 1)
+            .copy(pMapping->szInternalClient, sizeof(pMapping->szInternalClient) - 1);
         pMapping->szInternalClient[nPort - nHost - 1] = '\0';
         pMapping->nInternalPort = std::atoi(szItem.c_str() + nPort + 1);
     }

@@ -9,7 +9,7 @@ import time
 
 import homelab
 import networks
-from homelab import BOX, BUILD, GATEWAY, LAN2, WAN, wait_for
+from homelab import BOX, BUILD, LAN2, WAN, wait_for
 
 TOOL = f"{BUILD}/cli/tavoportmap"
 CHECKD = f"{BUILD}/programs/tavoportcheckd"

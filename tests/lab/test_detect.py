@@ -1,7 +1,6 @@
 """What the box finds out about the router, in every network that it may find itself in."""
 import json
 import os
-import signal
 import unittest
 
 import homelab

@@ -279,7 +279,7 @@ class Checker(unittest.TestCase):
             {"protocol": "tcp", "port": 7000 + i, "challenge": False} for i in range(ports)]})
         headers = {"Authorization": f"Bearer {token}", "Content-Type": "application/json"} | {
             key.replace("_", "-"): value for key, value in headers.items()}
-        out = LAB.run(host, f"curl -gs -m 20 -w '\\n%{{http_code}}' -X POST --data-binary @- "
+        out = LAB.run(host, "curl -gs -m 20 -w '\\n%{http_code}' -X POST --data-binary @- "
                       + " ".join(f"-H '{key}: {value}'" for key, value in headers.items()) + f" '{url}/v1/ports'",
                       check=False, input=body).stdout
         answer, _, status = out.rpartition("\n")

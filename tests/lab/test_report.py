@@ -6,7 +6,6 @@ import os
 import re
 import shutil
 import signal
-import subprocess
 import tarfile
 import unittest
 

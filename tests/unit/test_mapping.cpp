@@ -326,6 +326,39 @@ TEST(Mapping, AnAnswerThatIsLostIsAskedForAgainSoon) {
     EXPECT_EQ(result.nNextSeconds, 10);
 }
 
+// Each look takes a second, and a pass has a hundred and fifty: the next one goes on where it ended, and what is not
+// reached yet is unknown, at a router that answers.
+TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
+    class Slow : public MemoryRouter {
+    public:
+        explicit Slow(int64_t& nNow) : mNNow(nNow) { mNListCode = 401; }
+        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+            ++mNNow;
+            return MemoryRouter::Get(szProtocol, nPort, mapping);
+        }
+
+    private:
+        int64_t& mNNow;
+    };
+    Core core;
+    Slow router(core.nNow);
+    std::vector<RouterMapping> rgWanted;
+    for (uint16_t nPort = 1; nPort <= 300; ++nPort) {
+        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+    }
+    for (int i = 0; i < 12; ++i) {
+        const auto result = core.Run(router, rgWanted);
+        ASSERT_EQ(result.rgOutcomes.size(), rgWanted.size());
+        EXPECT_TRUE(result.blUnfinished);
+        EXPECT_TRUE(result.transport.IsOk()) << "slow is not silent";
+        EXPECT_EQ(result.nNextSeconds, 10);
+        for (const tavo::Outcome& outcome : result.rgOutcomes) {
+            EXPECT_EQ(outcome.verdict.szWord, outcome.verdict.enState == tavo::PortState::kOpen ? "1" : "timeout");
+        }
+    }
+    EXPECT_EQ(router.mMapTable.size(), rgWanted.size());
+}
+
 // One that keeps a mapping beyond its lease is not asked about it every few seconds for ever.
 TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
     MemoryRouter router;
