@@ -2,7 +2,7 @@
 // Promises: the name here is not exported.
 #pragma once
 
-#include "OperationRules.h"
+#include "merge/OperationRules.h"
 
 namespace tavo::lib {
 

@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "HopLink.h"
-#include "RuleConflicts.h"
+#include "merge/RuleConflicts.h"
 
 namespace {
 

@@ -2,7 +2,7 @@
 // the stores' readers. Promises: see InitState.h.
 #include "InitState.h"
 
-#include "OperationRules.h"
+#include "merge/OperationRules.h"
 
 namespace tavo::lib {
 

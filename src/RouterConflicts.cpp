@@ -4,7 +4,7 @@
 #include <cstring>
 #include <unordered_set>
 
-#include "RuleConflicts.h"
+#include "merge/RuleConflicts.h"
 #include "tavo/net.h"
 #include "tavo/upnp.h"
 

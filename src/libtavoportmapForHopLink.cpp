@@ -10,7 +10,7 @@
 
 #include "HopLink.h"
 #include "InitState.h"
-#include "RuleConflicts.h"
+#include "merge/RuleConflicts.h"
 
 namespace {
 

@@ -7,7 +7,7 @@
 #include <set>
 #include <string>
 
-#include "OperationRules.h"
+#include "merge/OperationRules.h"
 
 namespace {
 

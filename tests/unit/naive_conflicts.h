@@ -4,7 +4,7 @@
 
 #include <algorithm>
 
-#include "RuleConflicts.h"
+#include "merge/RuleConflicts.h"
 
 namespace naive {
 

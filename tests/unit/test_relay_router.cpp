@@ -3,7 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "InitState.h"
-#include "RuleConflicts.h"
+#include "merge/RuleConflicts.h"
 #include "network.h"
 #include "world.h"
 

@@ -5,7 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "OperationRules.h"
+#include "merge/OperationRules.h"
 #include "network.h"
 #include "stage.h"
 #include "tavo/core.h"
