@@ -1,10 +1,15 @@
 // What a merge costs: one pass of ports 1 to N against 1 to N, by the library's index and by walking the
-// lists. Relies on Google Benchmark. Promises: both sides in one run, and the ratio of their processor
-// time at the end.
+// lists; and what a whole merge of wide rules holds. Relies on Google Benchmark. Promises: both sides in one run,
+// and at the end the ratio of their processor time and the peak of memory, each merge in a process of its own.
 #include <benchmark/benchmark.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include <chrono>
 #include <cstdio>
 #include <map>
+#include <vector>
 
 #include "naive_conflicts.h"
 
@@ -44,6 +49,40 @@ void ThreePasses(benchmark::State& state, Pass pfnPass) {
     }
 }
 
+// A service's request for every port meets nRules stored rules of every port, from the records to the records.
+bool MergeWideRules(int nRules, const char* szOwner, bool blEnabled) {
+    __tag_TAVO_ROUTER_RULE rule = {};
+    rule.blEnable = blEnabled;
+    FillText(rule.szProtocol, "tcp");
+    FillText(rule.szRouterPort, "1-65535");
+    FillText(rule.szSrcPort, "1-65535");
+    FillText(rule.szServiceName, szOwner);
+    const std::vector<__tag_TAVO_ROUTER_RULE> rgStored(static_cast<size_t>(nRules), rule);
+    OperationRules stored;
+    OneRule request(65535);
+    RouterRules merged;
+    return CreateOperationRulesArray(&stored.rgRules, &stored.nRules, rgStored.data(), nRules) == 0 &&
+           DeletePortsFromRuleConf(stored.rgRules, stored.nRules, "hoplink") == 0 &&
+           DeletePortsFromInputRules(request.rgRules, 1, stored.rgRules, stored.nRules, "hoplink") == 0 &&
+           CreateRulesArray(&merged.rgRules, &merged.nRules, stored.rgRules, stored.nRules, request.rgRules, 1) == 0 &&
+           request.rgRules->blDeleted && merged.nRules == nRules;
+}
+
+// In a process of its own, whose peak is the merge's.
+void PrintPeak(int nRules, const char* szWhat, const char* szOwner, bool blEnabled) {
+    const auto start = std::chrono::steady_clock::now();
+    const pid_t nPid = fork();
+    if (nPid == 0) {
+        _exit(MergeWideRules(nRules, szOwner, blEnabled) ? 0 : 1);
+    }
+    int nStatus = -1;
+    rusage usage = {};
+    const bool blDone = nPid > 0 && wait4(nPid, &nStatus, 0, &usage) == nPid && nStatus == 0;
+    const std::chrono::duration<double, std::milli> time = std::chrono::steady_clock::now() - start;
+    std::printf("%d rules 1-65535 %s: %s, peak %.1f MB, %.0f ms\n", nRules, szWhat, blDone ? "merged" : "FAILED",
+                static_cast<double>(usage.ru_maxrss) / 1024, time.count());
+}
+
 class RatioReporter : public benchmark::ConsoleReporter {
 public:
     void ReportRuns(const std::vector<Run>& rgRuns) override {
@@ -71,6 +110,11 @@ private:
 
 int main(int argc, char** argv) {
     benchmark::Initialize(&argc, argv);
+    for (const int nRules : {1, 400}) {
+        PrintPeak(nRules, "of a user", "", true);
+        PrintPeak(nRules, "switched off for the service", "hoplink", false);
+    }
+    std::fflush(stdout);
     for (const auto& [szSide, pfnPass] : {std::pair<const char*, Pass>("indexed", tavo::lib::DeletePortsFromRules1),
                                           std::pair<const char*, Pass>("walked", naive::DeletePortsFromRules1)}) {
         for (const int nPorts : {1, 64, 1024, 65535}) {
