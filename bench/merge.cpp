@@ -17,13 +17,14 @@ namespace {
 
 using namespace tavo::lib;
 
-using Pass = int (*)(OPERATION_RULE*, int, const OPERATION_RULE*, int, bool, const RULE_FILTER*, const RULE_FILTER*);
+using Pass = int (*)(const MergeHost&, OPERATION_RULE*, int, const OPERATION_RULE*, int, bool, const RULE_FILTER*,
+                     const RULE_FILTER*, MergeObserver*);
 
 struct OneRule : OperationRules {
     explicit OneRule(int nPorts) {
         __tag_TAVO_PORTMAP_RULE request = {};
         FillText(request.szPorts, "1-" + std::to_string(nPorts));
-        CreateOperationRulesArray(&rgRules, &nRules, "hoplink", &request, 1);
+        CreateOperationRulesArray(Host(), &rgRules, &nRules, "hoplink", &request, 1);
     }
 };
 
@@ -36,9 +37,9 @@ void ThreePasses(benchmark::State& state, Pass pfnPass) {
         {
             OneRule disabled(nPorts), request(nPorts), again(nPorts), user(nPorts);
             state.ResumeTiming();
-            int nResult = pfnPass(disabled.rgRules, 1, request.rgRules, 1, false, nullptr, nullptr);
-            nResult |= pfnPass(request.rgRules, 1, user.rgRules, 1, true, nullptr, nullptr);
-            nResult |= pfnPass(again.rgRules, 1, disabled.rgRules, 1, true, nullptr, nullptr);
+            int nResult = pfnPass(Host(), disabled.rgRules, 1, request.rgRules, 1, false, nullptr, nullptr, nullptr);
+            nResult |= pfnPass(Host(), request.rgRules, 1, user.rgRules, 1, true, nullptr, nullptr, nullptr);
+            nResult |= pfnPass(Host(), again.rgRules, 1, disabled.rgRules, 1, true, nullptr, nullptr, nullptr);
             state.PauseTiming();
             if (nResult != 0 || disabled.rgRules->blDeleted || !request.rgRules->blDeleted ||
                 !again.rgRules->blDeleted) {
@@ -61,10 +62,11 @@ bool MergeWideRules(int nRules, const char* szOwner, bool blEnabled) {
     OperationRules stored;
     OneRule request(65535);
     RouterRules merged;
-    return CreateOperationRulesArray(&stored.rgRules, &stored.nRules, rgStored.data(), nRules) == 0 &&
-           DeletePortsFromRuleConf(stored.rgRules, stored.nRules, "hoplink") == 0 &&
-           DeletePortsFromInputRules(request.rgRules, 1, stored.rgRules, stored.nRules, "hoplink") == 0 &&
-           CreateRulesArray(&merged.rgRules, &merged.nRules, stored.rgRules, stored.nRules, request.rgRules, 1) == 0 &&
+    return CreateOperationRulesArray(Host(), &stored.rgRules, &stored.nRules, rgStored.data(), nRules) == 0 &&
+           DeletePortsFromRuleConf(Host(), stored.rgRules, stored.nRules, "hoplink") == 0 &&
+           DeletePortsFromInputRules(Host(), request.rgRules, 1, stored.rgRules, stored.nRules, "hoplink") == 0 &&
+           CreateRulesArray(Host(), &merged.rgRules, &merged.nRules, stored.rgRules, stored.nRules, request.rgRules,
+                            1) == 0 &&
            request.rgRules->blDeleted && merged.nRules == nRules;
 }
 

@@ -1,10 +1,14 @@
-// What the relay service's entry points share with the diagnostic ones. Relies on the operation rules.
-// Promises: the name here is not exported.
+// What the relay service's entry points share with the diagnostic ones. Relies on the merge. Promises: none of the
+// names here is exported.
 #pragma once
 
-#include "merge/OperationRules.h"
+#include "common.h"
+#include "src/merge/OperationRules.h"
 
 namespace tavo::lib {
+
+// The library as the merge's host: its log, and the platform's test of a port number.
+const MergeHost& Host();
 
 // Tests from outside the rules made from as many requests, and writes each verdict into its request. 0, or
 // -1: the requests are as they were.

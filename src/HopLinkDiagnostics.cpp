@@ -4,11 +4,12 @@
 #include <cstring>
 
 #include "HopLink.h"
-#include "merge/RuleConflicts.h"
+#include "RouterConflicts.h"
 
 namespace {
 
 using tavo::lib::AtBorder;
+using tavo::lib::Host;
 using tavo::lib::kHopLinkFile;
 using tavo::lib::LogError;
 using tavo::lib::OPERATION_RULE;
@@ -31,7 +32,7 @@ void PrintPorts(const char* szTitle, const PortList& ports) {
 void PrintRule(const OPERATION_RULE& rule, int i) {
     std::printf("[%d]\n", i);
     std::printf("enable=%d\n", rule.blEnable);
-    std::printf("protocol=%s\n", tavo::lib::ToProtocolString(rule.protocol));
+    std::printf("protocol=%s\n", tavo::lib::ToProtocolString(Host(), rule.protocol));
     PrintPorts("router ports=", *rule.routerPortSet);
     PrintPorts("box ports=", *rule.boxPortSet);
     std::printf("service id=%s\n", rule.szServiceId);
@@ -47,7 +48,7 @@ int PrintRuleConf() {
         return -1;
     }
     tavo::lib::OperationRules rules;
-    if (CreateOperationRulesArray(&rules.rgRules, &rules.nRules, stored.rgRules, stored.nRules) != 0) {
+    if (CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, stored.rgRules, stored.nRules) != 0) {
         LogError("%s:%d CreateOperationRulesArray(ruleConf) failed", kHopLinkFile, __LINE__);
         return -1;
     }
@@ -71,7 +72,7 @@ bool ReadProtocol(int& enProtocol, const char* szProtocol) {
     }
     for (const auto protocol :
          {tavo::lib::PORTMAP_PROTOCOL_TCP, tavo::lib::PORTMAP_PROTOCOL_UDP, tavo::lib::PORTMAP_PROTOCOL_ALL}) {
-        if (std::strcmp(szProtocol, tavo::lib::ToProtocolString(protocol)) == 0) {
+        if (std::strcmp(szProtocol, tavo::lib::ToProtocolString(Host(), protocol)) == 0) {
             enProtocol = protocol;
             return true;
         }
@@ -112,7 +113,7 @@ bool ReadRequests(ServiceRequests& requests, const char* szRequest) {
 // Prints the ports of one side, or says which side cannot be written.
 bool DumpPorts(const char* szSide, const PortList& ports) {
     char szPorts[TAVO_TEXT_SIZE] = {};
-    if (tavo::lib::ToPorts(szPorts, TAVO_TEXT_SIZE, ports) != 0) {
+    if (tavo::lib::ToPorts(Host(), szPorts, TAVO_TEXT_SIZE, ports) != 0) {
         std::printf("ToPorts(%s) failed\n", szSide);
         return false;
     }
@@ -129,13 +130,13 @@ void DumpOperationRules(const char* szTitle, const OPERATION_RULE* rgOpRules, in
         if (!DumpPorts("router", *rule.routerPortSet) || !DumpPorts("box", *rule.boxPortSet)) {
             return;
         }
-        std::printf("protocol=%s\n\n", tavo::lib::ToProtocolString(rule.protocol));
+        std::printf("protocol=%s\n\n", tavo::lib::ToProtocolString(Host(), rule.protocol));
     }
 }
 
 bool CreateOperationRules(tavo::lib::OperationRules& rules, const ServiceRequests& requests) {
-    if (CreateOperationRulesArray(&rules.rgRules, &rules.nRules, requests.szServiceName.c_str(), requests.rgRules,
-                                  requests.nRules) != 0) {
+    if (CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, requests.szServiceName.c_str(),
+                                  requests.rgRules, requests.nRules) != 0) {
         std::puts("CreateOperationRulesArray(rgRules) failed");
         return false;
     }
@@ -158,7 +159,7 @@ int TestRequests(const char* szRequest) {
         return -1;
     }
     tavo::lib::RouterRules rules;
-    if (CreateRulesArray(&rules.rgRules, &rules.nRules, nullptr, 0, opRules.rgRules, opRules.nRules) != 0) {
+    if (CreateRulesArray(Host(), &rules.rgRules, &rules.nRules, nullptr, 0, opRules.rgRules, opRules.nRules) != 0) {
         LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
         return -1;
     }
@@ -216,7 +217,7 @@ int FormatNumbers(char* szOut, int nOut, const char* szNumbers) {
         }
         ports.push_back(tavo::lib::ToInt(szNumber));
     }
-    if (tavo::lib::ToPorts(szOut, nOut, ports) != 0) {
+    if (tavo::lib::ToPorts(Host(), szOut, nOut, ports) != 0) {
         LogError("%s:%d ToPorts() failed", kHopLinkFile, __LINE__);
         return -1;
     }

@@ -2,7 +2,8 @@
 // the stores' readers. Promises: see InitState.h.
 #include "InitState.h"
 
-#include "merge/OperationRules.h"
+#include "common.h"
+#include "src/merge/MergeHost.h"
 
 namespace tavo::lib {
 

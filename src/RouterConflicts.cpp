@@ -1,10 +1,11 @@
-// Takes away what other hosts already hold on a UPnP router. Relies on the router's settings and on the
-// platform's UPnP client and network library. Promises: a router that is not known to speak UPnP is not
-// asked, and takes nothing away.
-#include <cstring>
-#include <unordered_set>
+// Asks a UPnP router what other hosts hold, and takes it away. Relies on the router's settings, on the platform's UPnP
+// client and network library, and on the merge. Promises: see RouterConflicts.h.
+#include "RouterConflicts.h"
 
-#include "merge/RuleConflicts.h"
+#include <cstring>
+
+#include "HopLink.h"
+#include "src/merge/UsedPorts.h"
 #include "tavo/net.h"
 #include "tavo/upnp.h"
 
@@ -17,13 +18,6 @@ constexpr int kInterfacesWithAddress = 2;  // the network library's kind: up, wi
 constexpr size_t kGatewaySize = 20;
 constexpr int kSearchLimitSeconds = 30;
 constexpr int kSearchLocalPort = 55002;
-
-using PortSet = std::unordered_set<int>;
-
-struct UsedPorts {
-    PortSet tcp;
-    PortSet udp;
-};
 
 // The box's address on the gateway's subnet.
 bool GetDefaultGatewayInterfaceIp(std::string& szLocal) {
@@ -49,7 +43,7 @@ bool GetDefaultGatewayInterfaceIp(std::string& szLocal) {
 }
 
 // One mapping of the router's table that is in force and not the box's own.
-void AppendUsedPort(PortList& tcpPorts, PortList& udpPorts, const TAVO_UPNP_PORT_MAPPING& mapping) {
+void AppendUsedPort(std::list<int>& tcpPorts, std::list<int>& udpPorts, const TAVO_UPNP_PORT_MAPPING& mapping) {
     if (std::strcmp(mapping.szProtocol, "TCP") == 0) {
         tcpPorts.push_back(mapping.nExternalPort);
     } else if (std::strcmp(mapping.szProtocol, "UDP") == 0) {
@@ -74,55 +68,6 @@ bool IsUpnpRouter(const std::string& szGateway, bool& blUpnp) {
     return true;
 }
 
-bool HasEqualSides(const OPERATION_RULE& opRule) {
-    if (opRule.routerPortSet->size() == opRule.boxPortSet->size()) {
-        return true;
-    }
-    LogError("%s:%d router port number = %d != box port number =%d", kHopLinkFile, __LINE__,
-             static_cast<int>(opRule.routerPortSet->size()), static_cast<int>(opRule.boxPortSet->size()));
-    return false;
-}
-
-// A rule for both protocols is held against the TCP mappings alone; that is meant.
-const PortSet* UsedBy(PORTMAP_PROTOCOL protocol, const UsedPorts& used) {
-    switch (protocol) {
-        case PORTMAP_PROTOCOL_TCP:
-        case PORTMAP_PROTOCOL_ALL:
-            return &used.tcp;
-        case PORTMAP_PROTOCOL_UDP:
-            return &used.udp;
-    }
-    return nullptr;
-}
-
-int DeleteConflictPortsFromOpRule(OPERATION_RULE& opRule, const UsedPorts& used) {
-    if (opRule.routerPortSet == nullptr) {
-        LogError("%s:%d opRule.routerPortSet == NULL", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    if (opRule.boxPortSet == nullptr) {
-        LogError("%s:%d opRule.boxPortSet == NULL", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    if (!HasEqualSides(opRule)) {
-        return -1;
-    }
-    if (opRule.routerPortSet->empty()) {
-        return 0;
-    }
-    const PortSet* pUsed = UsedBy(opRule.protocol, used);
-    RemovePairs(opRule, [pUsed](int nRouterPort, int /*nBoxPort*/) {
-        return std::optional(pUsed != nullptr && pUsed->count(nRouterPort) != 0);
-    });
-    if (!HasEqualSides(opRule)) {
-        return -1;
-    }
-    if (opRule.routerPortSet->empty()) {
-        opRule.blDeleted = true;
-    }
-    return 0;
-}
-
 bool CheckArguments(const OPERATION_RULE* rgOpRules, int nOpRules, const OPERATION_RULE* rgOpConfRules,
                     int nOpConfRules) {
     if (nOpRules < 0) {
@@ -144,25 +89,9 @@ bool CheckArguments(const OPERATION_RULE* rgOpRules, int nOpRules, const OPERATI
     return true;
 }
 
-// The service's rules of one array (all of them for a null name), the deleted ones too. szFailure takes the
-// file, the line and the index.
-bool DeleteConflictPorts(OPERATION_RULE* rgOpRules, int nOpRules, const char* szServiceName, const UsedPorts& used,
-                         const char* szFailure) {
-    for (int i = 0; i < nOpRules; ++i) {
-        if (szServiceName != nullptr && !IsOf(rgOpRules[i], szServiceName)) {
-            continue;
-        }
-        if (DeleteConflictPortsFromOpRule(rgOpRules[i], used) != 0) {
-            LogError(szFailure, kHopLinkFile, __LINE__, i);
-            return false;
-        }
-    }
-    return true;
-}
-
 }  // namespace
 
-int GetUsedRouterPortList(PortList& tcpPorts, PortList& udpPorts) {
+int GetUsedRouterPortList(std::list<int>& tcpPorts, std::list<int>& udpPorts) {
     std::string szLocal;
     if (!GetDefaultGatewayInterfaceIp(szLocal)) {
         LogError("%s:%d GetDefaultGatewayInterfaceIp() failed", kHopLinkFile, __LINE__);
@@ -207,19 +136,14 @@ int DeleteConflictPortsForUPnPRouter(OPERATION_RULE* rgOpRules, int nOpRules, OP
     if (!blUpnp) {
         return 0;
     }
-    PortList tcpPorts;
-    PortList udpPorts;
+    std::list<int> tcpPorts;
+    std::list<int> udpPorts;
     if (GetUsedRouterPortList(tcpPorts, udpPorts) != 0) {
         LogError("%s:%d GetUsedRouterPortList() failed", kHopLinkFile, __LINE__);
         return -1;
     }
-    const UsedPorts used{PortSet(tcpPorts.begin(), tcpPorts.end()), PortSet(udpPorts.begin(), udpPorts.end())};
-    return DeleteConflictPorts(rgOpRules, nOpRules, szServiceName, used,
-                               "%s:%d DeleteConflictPortsForUPnPRouter(rgOpRules[%d]) failed") &&
-                   DeleteConflictPorts(rgOpConfRules, nOpConfRules, szServiceName, used,
-                                       "%s:%d DeleteConflictPortsForUPnPRouter(rgOpConfRules[%d]) failed")
-               ? 0
-               : -1;
+    return DeleteUsedPorts(Host(), rgOpRules, nOpRules, rgOpConfRules, nOpConfRules, szServiceName,
+                           {{tcpPorts.begin(), tcpPorts.end()}, {udpPorts.begin(), udpPorts.end()}});
 }
 
 }  // namespace tavo::lib

@@ -229,12 +229,16 @@ int ReadText(std::string& szValue, const char* szKey, const TAVO_PF_CONF* pConf)
 namespace tavo::lib {
 
 void LogError(const char* szFormat, ...) {
+    va_list arguments;
+    va_start(arguments, szFormat);
+    LogErrorV(szFormat, arguments);
+    va_end(arguments);
+}
+
+void LogErrorV(const char* szFormat, va_list arguments) {
     const int nErrno = errno;
     char* szLine = nullptr;
-    va_list args;
-    va_start(args, szFormat);
-    const int nLength = vasprintf(&szLine, szFormat, args);
-    va_end(args);
+    const int nLength = vasprintf(&szLine, szFormat, arguments);
     if (nLength >= 0) {
         syslog(LOG_ERR, "%s", szLine);
         std::free(szLine);

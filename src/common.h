@@ -5,6 +5,7 @@
 
 #include <sys/stat.h>
 
+#include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
@@ -53,6 +54,7 @@ inline constexpr size_t kCommandSize = 4096;
 // One line of the system log at priority error. Every format begins "%s:%d ": the source path relative
 // to the tree, then the line. errno is kept, so "%m" works and callers may still look at it.
 void LogError(const char* szFormat, ...) __attribute__((format(printf, 1, 2)));
+void LogErrorV(const char* szFormat, va_list arguments);
 
 struct FreeDeleter {
     void operator()(void* pBlock) const { std::free(pBlock); }

@@ -4,18 +4,16 @@
 // and nothing is thrown.
 #include <unistd.h>
 
-#include <algorithm>
-#include <climits>
-#include <cstring>
-
 #include "HopLink.h"
 #include "InitState.h"
-#include "merge/RuleConflicts.h"
+#include "RouterConflicts.h"
+#include "src/merge/RuleConflicts.h"
 
 namespace {
 
 using tavo::lib::AtBorder;
 using tavo::lib::FillText;
+using tavo::lib::Host;
 using tavo::lib::kHopLinkFile;
 using tavo::lib::kRouterLock;
 using tavo::lib::LogError;
@@ -35,61 +33,21 @@ constexpr int kTestRules = 60;  // mappings that the compatibility test asks for
 enum RulesSetAnswer : int { kRulesSet = 0, kNotInitialized = 1, kRulesSetLocked = 2 };
 enum RouterAnswer : int { kAutomatic = 0, kManual = 1, kRouterLocked = 2 };
 
-// sscanf leaves a value outside its type undefined; read wide and clamped, it is refused as a port.
-void ReadRange(const char* szToken, int& nLow, int& nHigh) {
-    long nFirst = 0;
-    long nLast = 0;
-    std::sscanf(szToken, "%ld-%ld", &nFirst, &nLast);
-    nLow = static_cast<int>(std::clamp(nFirst, long{INT_MIN}, long{INT_MAX}));
-    nHigh = static_cast<int>(std::clamp(nLast, long{INT_MIN}, long{INT_MAX}));
-}
+// The library as the merge's host.
+class LibraryHost : public tavo::lib::MergeHost {
+public:
+    bool IsValidPortNo(int nPort) const override { return TAVOPFIsValidPortNo(nPort) != 0; }
 
-bool AppendRange(PortList& ports, const char* szToken) {
-    int nLow = 0;
-    int nHigh = 0;
-    ReadRange(szToken, nLow, nHigh);
-    if (TAVOPFIsValidPortNo(nLow) == 0 || TAVOPFIsValidPortNo(nHigh) == 0) {
-        LogError("%s:%d invalid port range [%d-%d]", kHopLinkFile, __LINE__, nLow, nHigh);
-        return false;
-    }
-    if (nLow > nHigh) {
-        std::swap(nLow, nHigh);
-    }
-    for (int nPort = nLow; nPort <= nHigh; ++nPort) {
-        ports.push_back(nPort);
-    }
-    return true;
-}
+private:
+    void Log(const char* szFormat, va_list arguments) const override { tavo::lib::LogErrorV(szFormat, arguments); }
+};
 
-bool AppendPort(PortList& ports, const char* szToken) {
-    const int nPort = tavo::lib::ToInt(szToken);
-    if (TAVOPFIsValidPortNo(nPort) == 0) {
-        LogError("%s:%d invalid port no [%s]", kHopLinkFile, __LINE__, szToken);
-        return false;
-    }
-    ports.push_back(nPort);
-    return true;
-}
-
-int ParsePorts(PortList& ports, const char* szPort) {
-    if (szPort == nullptr) {
-        LogError("%s:%d Bad parameter, NULL == szPort", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    std::string szCopy = szPort;
-    char* pRest = nullptr;
-    const char* szToken = strtok_r(szCopy.data(), ",", &pRest);
-    if (szToken == nullptr) {
-        LogError("%s:%d invalid port format", kHopLinkFile, __LINE__);
-        return -1;
-    }
-    for (; szToken != nullptr; szToken = strtok_r(nullptr, ",", &pRest)) {
-        const bool blRange = std::strchr(szToken, '-') != nullptr;
-        if (!(blRange ? AppendRange(ports, szToken) : AppendPort(ports, szToken))) {
-            return -1;
-        }
-    }
-    return 0;
+// What stands before a bad token is the caller's too.
+int AppendPorts(std::list<int>& ports, const char* szPort) {
+    PortList read;
+    const int nResult = ParsePorts(Host(), read, szPort);
+    ports.insert(ports.end(), read.begin(), read.end());
+    return nResult;
 }
 
 // ---- a service sets its rules --------------------------------------------------------------------------
@@ -168,7 +126,8 @@ private:
 };
 
 bool ServiceRules::BuildFromRequests(OperationRules& rules) const {
-    if (CreateOperationRulesArray(&rules.rgRules, &rules.nRules, mSzServiceName, mRgRequests, mNRequests) != 0) {
+    if (CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, mSzServiceName, mRgRequests, mNRequests) !=
+        0) {
         LogError("%s:%d CreateOperationRulesArray(rgRules) fail", kHopLinkFile, __LINE__);
         return false;
     }
@@ -181,7 +140,7 @@ bool ServiceRules::Load() {
         LogError("%s:%d TLibGetRulesArrFromRuleConf() failed", kHopLinkFile, __LINE__);
         return false;
     }
-    if (CreateOperationRulesArray(&mStored.rgRules, &mStored.nRules, stored.rgRules, stored.nRules) != 0) {
+    if (CreateOperationRulesArray(Host(), &mStored.rgRules, &mStored.nRules, stored.rgRules, stored.nRules) != 0) {
         LogError("%s:%d CreateOperationRulesArray(ruleConf) failed", kHopLinkFile, __LINE__);
         return false;
     }
@@ -189,12 +148,12 @@ bool ServiceRules::Load() {
 }
 
 bool ServiceRules::Merge() {
-    if (tavo::lib::DeletePortsFromRuleConf(mStored.rgRules, mStored.nRules, mSzServiceName) != 0) {
+    if (tavo::lib::DeletePortsFromRuleConf(Host(), mStored.rgRules, mStored.nRules, mSzServiceName) != 0) {
         LogError("%s:%d DeletePortsFromRuleConf(rule.conf rules=%d) failed", kHopLinkFile, __LINE__, mStored.nRules);
         return false;
     }
-    if (tavo::lib::DeletePortsFromInputRules(mRequested.rgRules, mRequested.nRules, mStored.rgRules, mStored.nRules,
-                                             mSzServiceName) != 0) {
+    if (tavo::lib::DeletePortsFromInputRules(Host(), mRequested.rgRules, mRequested.nRules, mStored.rgRules,
+                                             mStored.nRules, mSzServiceName) != 0) {
         LogError("%s:%d DeletePortsFromRuleConf(input rules=%d) failed", kHopLinkFile, __LINE__, mRequested.nRules);
         return false;
     }
@@ -208,7 +167,7 @@ bool ServiceRules::Merge() {
 
 bool ServiceRules::Save() {
     RouterRules merged;
-    if (CreateRulesArray(&merged.rgRules, &merged.nRules, mStored.rgRules, mStored.nRules, mRequested.rgRules,
+    if (CreateRulesArray(Host(), &merged.rgRules, &merged.nRules, mStored.rgRules, mStored.nRules, mRequested.rgRules,
                          mRequested.nRules) != 0) {
         LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
         return false;
@@ -234,7 +193,8 @@ bool ServiceRules::Test() {
         return false;
     }
     RouterRules tested;
-    if (CreateRulesArray(&tested.rgRules, &tested.nRules, nullptr, 0, requested.rgRules, requested.nRules) != 0) {
+    if (CreateRulesArray(Host(), &tested.rgRules, &tested.nRules, nullptr, 0, requested.rgRules, requested.nRules) !=
+        0) {
         LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
         return false;
     }
@@ -409,6 +369,11 @@ int DetectRouter() {
 
 }  // namespace
 
+const tavo::lib::MergeHost& tavo::lib::Host() {
+    static const LibraryHost host;
+    return host;
+}
+
 int tavo::lib::TestRequestedRules(const RouterRules& rules, __tag_TAVO_PORTMAP_RULE* rgRequests) {
     if (TLibTestRulesInit() != 0) {
         LogError("%s:%d test rule init failed", kHopLinkFile, __LINE__);
@@ -425,7 +390,7 @@ int tavo::lib::TestRequestedRules(const RouterRules& rules, __tag_TAVO_PORTMAP_R
 }
 
 int TLibParsePorts(std::list<int>& ports, const char* szPort) {
-    return AtBorder(-1, [&] { return ParsePorts(ports, szPort); });
+    return AtBorder(-1, [&] { return AppendPorts(ports, szPort); });
 }
 
 int TLibTavoPortMapRulesSet(const char* szServiceName, __tag_TAVO_PORTMAP_RULE* rgRules, int nRules,

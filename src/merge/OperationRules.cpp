@@ -1,15 +1,19 @@
 // The operation rules: built from requests and from rule.conf, written back as public records. Relies on
-// the platform's test of a port number. Promises: a builder that fails frees what it made.
+// its host's test of a port number. Promises: a builder that fails frees what it made.
 #include "OperationRules.h"
 
 #include <algorithm>
+#include <climits>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
+#include <new>
 
 namespace {
 
 using tavo::lib::kHopLinkFile;
-using tavo::lib::LogError;
+using tavo::lib::MergeHost;
 using tavo::lib::OPERATION_RULE;
 using tavo::lib::PortList;
 
@@ -17,63 +21,119 @@ constexpr const char* kProtocols[] = {"tcp", "udp", "all"};
 constexpr char kRelayServiceName[] = "hoplink";
 constexpr char kRelayServiceId[] = "HopLink";
 
-bool MakeLists(OPERATION_RULE& rule) {
+template <size_t N>
+void FillText(char (&szField)[N], const char* szText) {
+    std::snprintf(szField, N, "%s", szText);
+}
+
+// sscanf leaves a value outside its type undefined; read wide and clamped, it is refused as a port.
+int Clamped(long nNumber) {
+    return static_cast<int>(std::clamp(nNumber, long{INT_MIN}, long{INT_MAX}));
+}
+
+bool AppendRange(const MergeHost& host, PortList& ports, const char* szToken) {
+    long nFirst = 0;
+    long nLast = 0;
+    std::sscanf(szToken, "%ld-%ld", &nFirst, &nLast);
+    const int nLow = Clamped(nFirst);
+    const int nHigh = Clamped(nLast);
+    if (!host.IsValidPortNo(nLow) || !host.IsValidPortNo(nHigh)) {
+        host.LogError("%s:%d invalid port range [%d-%d]", kHopLinkFile, __LINE__, nLow, nHigh);
+        return false;
+    }
+    ports.AppendRange(std::min(nLow, nHigh), std::max(nLow, nHigh));
+    return true;
+}
+
+bool AppendPort(const MergeHost& host, PortList& ports, const char* szToken) {
+    const int nPort = Clamped(std::strtol(szToken, nullptr, 10));
+    if (!host.IsValidPortNo(nPort)) {
+        host.LogError("%s:%d invalid port no [%s]", kHopLinkFile, __LINE__, szToken);
+        return false;
+    }
+    ports.push_back(nPort);
+    return true;
+}
+
+int ReadPorts(const MergeHost& host, PortList& ports, const char* szPort) {
+    if (szPort == nullptr) {
+        host.LogError("%s:%d Bad parameter, NULL == szPort", kHopLinkFile, __LINE__);
+        return -1;
+    }
+    std::string szCopy = szPort;
+    char* pRest = nullptr;
+    const char* szToken = strtok_r(szCopy.data(), ",", &pRest);
+    if (szToken == nullptr) {
+        host.LogError("%s:%d invalid port format", kHopLinkFile, __LINE__);
+        return -1;
+    }
+    for (; szToken != nullptr; szToken = strtok_r(nullptr, ",", &pRest)) {
+        const bool blRange = std::strchr(szToken, '-') != nullptr;
+        if (!(blRange ? AppendRange(host, ports, szToken) : AppendPort(host, ports, szToken))) {
+            return -1;
+        }
+    }
+    return 0;
+}
+
+bool MakeLists(const MergeHost& host, OPERATION_RULE& rule) {
     rule.routerPortSet = new (std::nothrow) PortList;
     rule.boxPortSet = new (std::nothrow) PortList;
     if (rule.routerPortSet == nullptr || rule.boxPortSet == nullptr) {
-        LogError("%s:%d new set<int> failed", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d new set<int> failed", kHopLinkFile, __LINE__);
         return false;
     }
     return true;
 }
 
-bool FillFromRequest(OPERATION_RULE& rule, const __tag_TAVO_PORTMAP_RULE& request, const char* szServiceName) {
+bool FillFromRequest(const MergeHost& host, OPERATION_RULE& rule, const __tag_TAVO_PORTMAP_RULE& request,
+                     const char* szServiceName) {
     rule.blEnable = true;
     rule.protocol = static_cast<tavo::lib::PORTMAP_PROTOCOL>(request.enProtocol);
-    if (!MakeLists(rule)) {
+    if (!MakeLists(host, rule)) {
         return false;
     }
-    if (TLibParsePorts(*rule.routerPortSet, request.szPorts) != 0) {
-        LogError("%s:%d TLibParsePorts() for routerPort failed", kHopLinkFile, __LINE__);
+    if (ParsePorts(host, *rule.routerPortSet, request.szPorts) != 0) {
+        host.LogError("%s:%d TLibParsePorts() for routerPort failed", kHopLinkFile, __LINE__);
         return false;
     }
-    if (TLibParsePorts(*rule.boxPortSet, request.szPorts) != 0) {
-        LogError("%s:%d TLibParsePorts() for boxPort failed", kHopLinkFile, __LINE__);
+    if (ParsePorts(host, *rule.boxPortSet, request.szPorts) != 0) {
+        host.LogError("%s:%d TLibParsePorts() for boxPort failed", kHopLinkFile, __LINE__);
         return false;
     }
-    tavo::lib::FillText(rule.szServiceName, szServiceName);
-    tavo::lib::FillText(rule.szServiceId, std::strcmp(szServiceName, kRelayServiceName) == 0 ? kRelayServiceId : "");
+    FillText(rule.szServiceName, szServiceName);
+    FillText(rule.szServiceId, std::strcmp(szServiceName, kRelayServiceName) == 0 ? kRelayServiceId : "");
     return true;
 }
 
-bool FillPorts(PortList& ports, const char* szPorts) {
-    if (TLibParsePorts(ports, szPorts) != 0) {
-        LogError("%s:%d TLibParsePorts(%s) failed", kHopLinkFile, __LINE__, szPorts);
+bool FillPorts(const MergeHost& host, PortList& ports, const char* szPorts) {
+    if (ParsePorts(host, ports, szPorts) != 0) {
+        host.LogError("%s:%d TLibParsePorts(%s) failed", kHopLinkFile, __LINE__, szPorts);
         return false;
     }
     return true;
 }
 
-bool FillFromRouterRule(OPERATION_RULE& rule, const __tag_TAVO_ROUTER_RULE& stored, int i) {
+bool FillFromRouterRule(const MergeHost& host, OPERATION_RULE& rule, const __tag_TAVO_ROUTER_RULE& stored, int i) {
     rule.blEnable = stored.blEnable;
-    const int nProtocol = tavo::lib::ToProtocolEnum(stored.szProtocol);
+    const int nProtocol = tavo::lib::ToProtocolEnum(host, stored.szProtocol);
     if (nProtocol < 0) {
-        LogError("%s:%d ToProtocolEnum([%d]=%d) failed", kHopLinkFile, __LINE__, i, nProtocol);
+        host.LogError("%s:%d ToProtocolEnum([%d]=%d) failed", kHopLinkFile, __LINE__, i, nProtocol);
         return false;
     }
     rule.protocol = static_cast<tavo::lib::PORTMAP_PROTOCOL>(nProtocol);
-    if (!MakeLists(rule) || !FillPorts(*rule.routerPortSet, stored.szRouterPort) ||
-        !FillPorts(*rule.boxPortSet, stored.szSrcPort)) {
+    if (!MakeLists(host, rule) || !FillPorts(host, *rule.routerPortSet, stored.szRouterPort) ||
+        !FillPorts(host, *rule.boxPortSet, stored.szSrcPort)) {
         return false;
     }
-    tavo::lib::FillText(rule.szServiceId, stored.szServiceID);
-    tavo::lib::FillText(rule.szServiceName, stored.szServiceName);
+    FillText(rule.szServiceId, stored.szServiceID);
+    FillText(rule.szServiceName, stored.szServiceName);
     return true;
 }
 
 // Hands out nRules records, the i-th filled by fnFill(record, i); null and 0 where that failed.
 template <typename Fill>
-int BuildArray(OPERATION_RULE** pRgOutRules, int* pnOutRules, int nRules, Fill fnFill) {
+int BuildArray(const MergeHost& host, OPERATION_RULE** pRgOutRules, int* pnOutRules, int nRules, Fill fnFill) {
     *pRgOutRules = nullptr;
     *pnOutRules = 0;
     if (nRules == 0) {
@@ -82,7 +142,7 @@ int BuildArray(OPERATION_RULE** pRgOutRules, int* pnOutRules, int nRules, Fill f
     tavo::lib::OperationRules rules;
     rules.rgRules = static_cast<OPERATION_RULE*>(std::calloc(static_cast<size_t>(nRules), sizeof(OPERATION_RULE)));
     if (rules.rgRules == nullptr) {
-        LogError("%s:%d malloc failed", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d malloc failed", kHopLinkFile, __LINE__);
         return -1;
     }
     rules.nRules = nRules;
@@ -96,58 +156,59 @@ int BuildArray(OPERATION_RULE** pRgOutRules, int* pnOutRules, int nRules, Fill f
 }
 
 // The refusals of the builder from rule.conf; a count of 0 is fine whatever the array.
-bool IsFitForBuilding(OPERATION_RULE* const* pRgOutRules, const __tag_TAVO_ROUTER_RULE* rgRules, int nRules) {
+bool IsFitForBuilding(const MergeHost& host, OPERATION_RULE* const* pRgOutRules, const __tag_TAVO_ROUTER_RULE* rgRules,
+                      int nRules) {
     if (*pRgOutRules != nullptr) {
-        LogError("%s:%d Bad parameter, *pRgOutRules is not NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, *pRgOutRules is not NULL", kHopLinkFile, __LINE__);
         return false;
     }
     if (nRules < 0) {
-        LogError("%s:%d 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
+        host.LogError("%s:%d 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
         return false;
     }
     if (nRules > 0 && rgRules == nullptr) {
-        LogError("%s:%d Bad parameter, rgRules is NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, rgRules is NULL", kHopLinkFile, __LINE__);
         return false;
     }
     return true;
 }
 
 // A cut text can end inside a number or a range and so name ports that the rule does not have: whoever looks
-// for them finds why. Room for one character more tells it from a text that just fits.
-bool FillOutPorts(char (&szField)[TAVO_TEXT_SIZE], const PortList& ports, int nId) {
-    char szText[TAVO_TEXT_SIZE + 1] = {};
-    if (tavo::lib::ToPorts(szText, sizeof(szText), ports) != 0) {
-        LogError("%s:%d ToPorts() failed", kHopLinkFile, __LINE__);
+// for them finds why.
+bool FillOutPorts(const MergeHost& host, char (&szField)[TAVO_TEXT_SIZE], const PortList& ports, int nId) {
+    const auto szText = tavo::lib::ToText(host, ports);
+    if (!szText) {
+        host.LogError("%s:%d ToPorts() failed", kHopLinkFile, __LINE__);
         return false;
     }
-    if (szText[TAVO_TEXT_SIZE - 1] != '\0') {
-        LogError("%s:%d ports of rule %d do not fit, cut at %d characters", kHopLinkFile, __LINE__, nId,
-                 TAVO_TEXT_SIZE - 1);
+    if (szText->size() >= TAVO_TEXT_SIZE) {
+        host.LogError("%s:%d ports of rule %d do not fit, cut at %d characters", kHopLinkFile, __LINE__, nId,
+                      TAVO_TEXT_SIZE - 1);
     }
-    tavo::lib::FillText(szField, szText);
+    FillText(szField, szText->c_str());
     return true;
 }
 
-bool FillRouterRule(__tag_TAVO_ROUTER_RULE& rule, const OPERATION_RULE& opRule, int nId) {
-    tavo::lib::FillText(rule.szRuleID, std::to_string(nId));
+bool FillRouterRule(const MergeHost& host, __tag_TAVO_ROUTER_RULE& rule, const OPERATION_RULE& opRule, int nId) {
+    FillText(rule.szRuleID, std::to_string(nId).c_str());
     rule.blEnable = opRule.blEnable;
-    tavo::lib::FillText(rule.szProtocol, tavo::lib::ToProtocolString(opRule.protocol));
+    FillText(rule.szProtocol, tavo::lib::ToProtocolString(host, opRule.protocol));
     if (opRule.routerPortSet == nullptr) {
-        LogError("%s:%d rgOpRules[i].routerPortSet is NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d rgOpRules[i].routerPortSet is NULL", kHopLinkFile, __LINE__);
         return false;
     }
-    if (!FillOutPorts(rule.szRouterPort, *opRule.routerPortSet, nId)) {
+    if (!FillOutPorts(host, rule.szRouterPort, *opRule.routerPortSet, nId)) {
         return false;
     }
     if (opRule.boxPortSet == nullptr) {
-        LogError("%s:%d rgOpRules[i].boxPortSet is NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d rgOpRules[i].boxPortSet is NULL", kHopLinkFile, __LINE__);
         return false;
     }
-    if (!FillOutPorts(rule.szSrcPort, *opRule.boxPortSet, nId)) {
+    if (!FillOutPorts(host, rule.szSrcPort, *opRule.boxPortSet, nId)) {
         return false;
     }
-    tavo::lib::FillText(rule.szServiceID, opRule.szServiceId);
-    tavo::lib::FillText(rule.szServiceName, opRule.szServiceName);
+    FillText(rule.szServiceID, opRule.szServiceId);
+    FillText(rule.szServiceName, opRule.szServiceName);
     rule.enTestStatus = 0;
     return true;
 }
@@ -162,22 +223,39 @@ int CountKept(const OPERATION_RULE* rgOpRules, int nOpRules) {
 
 namespace tavo::lib {
 
-int ToPorts(char* szOutPorts, int nOutPorts, const PortList& ports) {
+int ParsePorts(const MergeHost& host, PortList& ports, const char* szPort) {
+    try {
+        return ReadPorts(host, ports, szPort);
+    } catch (const std::bad_alloc&) {
+        return -1;
+    }
+}
+
+int ToPorts(const MergeHost& host, char* szOutPorts, int nOutPorts, const PortList& ports) {
     if (nOutPorts < 1) {
-        LogError("%s:%d Bad parameter, nOutPorts=%d", kHopLinkFile, __LINE__, nOutPorts);
+        host.LogError("%s:%d Bad parameter, nOutPorts=%d", kHopLinkFile, __LINE__, nOutPorts);
         return -1;
     }
     if (szOutPorts == nullptr) {
-        LogError("%s:%d Bad parameter, szOutPorts is NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, szOutPorts is NULL", kHopLinkFile, __LINE__);
         return -1;
     }
+    const auto szText = ToText(host, ports);
+    if (!szText) {
+        return -1;
+    }
+    std::snprintf(szOutPorts, static_cast<size_t>(nOutPorts), "%s", szText->c_str());
+    return 0;
+}
+
+std::optional<std::string> ToText(const MergeHost& host, const PortList& ports) {
     std::string szText;
     bool blRun = false;
     int nPrevious = 0;
     for (const int nPort : ports) {
-        if (TAVOPFIsValidPortNo(nPort) == 0) {
-            LogError("%s:%d TAVOPFIsValidPortNo(%d) failed", kHopLinkFile, __LINE__, nPort);
-            return -1;
+        if (!host.IsValidPortNo(nPort)) {
+            host.LogError("%s:%d TAVOPFIsValidPortNo(%d) failed", kHopLinkFile, __LINE__, nPort);
+            return std::nullopt;
         }
         if (szText.empty()) {
             szText = std::to_string(nPort);
@@ -199,60 +277,68 @@ int ToPorts(char* szOutPorts, int nOutPorts, const PortList& ports) {
     if (blRun) {
         szText += std::to_string(nPrevious);
     }
-    std::snprintf(szOutPorts, static_cast<size_t>(nOutPorts), "%s", szText.c_str());
-    return 0;
+    return szText;
 }
 
-int ToProtocolEnum(const char* szProtocol) {
+bool FitsRecord(const MergeHost& host, const OPERATION_RULE& rule) {
+    const auto fnFits = [&host](const PortList& ports) {
+        const auto szText = ToText(host, ports);
+        return szText && szText->size() < TAVO_TEXT_SIZE;
+    };
+    return fnFits(*rule.routerPortSet) && fnFits(*rule.boxPortSet);
+}
+
+int ToProtocolEnum(const MergeHost& host, const char* szProtocol) {
     for (size_t i = 0; i < std::size(kProtocols); ++i) {
         if (std::strcmp(szProtocol, kProtocols[i]) == 0) {
             return static_cast<int>(i);
         }
     }
-    LogError("%s:%d Bad parameter, szProtocol=%s", kHopLinkFile, __LINE__, szProtocol);
+    host.LogError("%s:%d Bad parameter, szProtocol=%s", kHopLinkFile, __LINE__, szProtocol);
     return -1;
 }
 
-const char* ToProtocolString(PORTMAP_PROTOCOL protocol) {
+const char* ToProtocolString(const MergeHost& host, PORTMAP_PROTOCOL protocol) {
     const auto nProtocol = static_cast<unsigned>(protocol);
     if (nProtocol >= std::size(kProtocols)) {
-        LogError("%s:%d non support protocol enum", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d non support protocol enum", kHopLinkFile, __LINE__);
         return "";
     }
     return kProtocols[nProtocol];
 }
 
-int CreateOperationRulesArray(OPERATION_RULE** pRgOutRules, int* pnOutRules, const char* szServiceName,
-                              const __tag_TAVO_PORTMAP_RULE* rgRules, int nRules) {
+int CreateOperationRulesArray(const MergeHost& host, OPERATION_RULE** pRgOutRules, int* pnOutRules,
+                              const char* szServiceName, const __tag_TAVO_PORTMAP_RULE* rgRules, int nRules) {
     if (*pRgOutRules != nullptr) {
-        LogError("%s:%d Bad parameter, rgOutRules is not NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, rgOutRules is not NULL", kHopLinkFile, __LINE__);
         return -1;
     }
     if (szServiceName == nullptr) {
-        LogError("%s:%d Bad parameter, szServiceName is NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, szServiceName is NULL", kHopLinkFile, __LINE__);
         return -1;
     }
     if (nRules < 0) {
-        LogError("%s:%d Bad parameter, 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
+        host.LogError("%s:%d Bad parameter, 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
         return -1;
     }
     if (nRules > 0 && rgRules == nullptr) {
-        LogError("%s:%d Bad parameter, nRules=%d >0, but rgRules is NULL", kHopLinkFile, __LINE__, nRules);
+        host.LogError("%s:%d Bad parameter, nRules=%d >0, but rgRules is NULL", kHopLinkFile, __LINE__, nRules);
         return -1;
     }
-    return BuildArray(pRgOutRules, pnOutRules, nRules,
-                      [&](OPERATION_RULE& rule, int i) { return FillFromRequest(rule, rgRules[i], szServiceName); });
+    return BuildArray(host, pRgOutRules, pnOutRules, nRules, [&](OPERATION_RULE& rule, int i) {
+        return FillFromRequest(host, rule, rgRules[i], szServiceName);
+    });
 }
 
-int CreateOperationRulesArray(OPERATION_RULE** pRgOutRules, int* pnOutRules, const __tag_TAVO_ROUTER_RULE* rgRules,
-                              int nRules) {
-    if (!IsFitForBuilding(pRgOutRules, rgRules, nRules)) {
+int CreateOperationRulesArray(const MergeHost& host, OPERATION_RULE** pRgOutRules, int* pnOutRules,
+                              const __tag_TAVO_ROUTER_RULE* rgRules, int nRules) {
+    if (!IsFitForBuilding(host, pRgOutRules, rgRules, nRules)) {
         *pRgOutRules = nullptr;  // every failure of this one clears the outputs
         *pnOutRules = 0;
         return -1;
     }
-    return BuildArray(pRgOutRules, pnOutRules, nRules,
-                      [&](OPERATION_RULE& rule, int i) { return FillFromRouterRule(rule, rgRules[i], i); });
+    return BuildArray(host, pRgOutRules, pnOutRules, nRules,
+                      [&](OPERATION_RULE& rule, int i) { return FillFromRouterRule(host, rule, rgRules[i], i); });
 }
 
 void FreeOperationRulesArray(OPERATION_RULE* rgRules, int nRules) {
@@ -266,17 +352,21 @@ void FreeOperationRulesArray(OPERATION_RULE* rgRules, int nRules) {
     std::free(rgRules);
 }
 
-int WriteRouterRules(int* pcRules, __tag_TAVO_ROUTER_RULE* rgRules, int nRules, const OPERATION_RULE* rgOpRules,
-                     int nOpRules) {
+void FreeRouterRulesArray(__tag_TAVO_ROUTER_RULE* rgRules, int /*nRules*/) {
+    std::free(rgRules);
+}
+
+int WriteRouterRules(const MergeHost& host, int* pcRules, __tag_TAVO_ROUTER_RULE* rgRules, int nRules,
+                     const OPERATION_RULE* rgOpRules, int nOpRules) {
     for (int i = 0; i < nOpRules; ++i) {
         if (rgOpRules[i].blDeleted) {
             continue;
         }
         if (*pcRules >= nRules) {
-            LogError("%s:%d out of range, cRules=%d >= nRules=%d", kHopLinkFile, __LINE__, *pcRules, nRules);
+            host.LogError("%s:%d out of range, cRules=%d >= nRules=%d", kHopLinkFile, __LINE__, *pcRules, nRules);
             return -1;
         }
-        if (!FillRouterRule(rgRules[*pcRules], rgOpRules[i], *pcRules + 1)) {
+        if (!FillRouterRule(host, rgRules[*pcRules], rgOpRules[i], *pcRules + 1)) {
             return -1;
         }
         ++*pcRules;
@@ -284,19 +374,20 @@ int WriteRouterRules(int* pcRules, __tag_TAVO_ROUTER_RULE* rgRules, int nRules, 
     return 0;
 }
 
-int CreateRulesArray(__tag_TAVO_ROUTER_RULE** pRgRules, int* pnRules, const OPERATION_RULE* rgRuleConfOpRules,
-                     int nRuleConfOpRules, const OPERATION_RULE* rgOpRules, int nOpRules) {
+int CreateRulesArray(const MergeHost& host, __tag_TAVO_ROUTER_RULE** pRgRules, int* pnRules,
+                     const OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules, const OPERATION_RULE* rgOpRules,
+                     int nOpRules) {
     if (*pRgRules != nullptr) {
-        LogError("%s:%d Bad parameter, rgRules is not NULL", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, rgRules is not NULL", kHopLinkFile, __LINE__);
         return -1;
     }
     if (nRuleConfOpRules > 0 && rgRuleConfOpRules == nullptr) {
-        LogError("%s:%d Bad parameter, 0 < nRuleConfOpRules=%d, but rgRuleConfOpRules is NULL", kHopLinkFile, __LINE__,
-                 nRuleConfOpRules);
+        host.LogError("%s:%d Bad parameter, 0 < nRuleConfOpRules=%d, but rgRuleConfOpRules is NULL", kHopLinkFile,
+                      __LINE__, nRuleConfOpRules);
         return -1;
     }
     if (nOpRules > 0 && rgOpRules == nullptr) {
-        LogError("%s:%d Bad parameter, 0 < nOpRules=%d, but rgOpRules is NULL", kHopLinkFile, __LINE__, nOpRules);
+        host.LogError("%s:%d Bad parameter, 0 < nOpRules=%d, but rgOpRules is NULL", kHopLinkFile, __LINE__, nOpRules);
         return -1;
     }
     *pnRules = 0;
@@ -308,13 +399,13 @@ int CreateRulesArray(__tag_TAVO_ROUTER_RULE** pRgRules, int* pnRules, const OPER
     rules.rgRules = static_cast<__tag_TAVO_ROUTER_RULE*>(
         std::calloc(static_cast<size_t>(rules.nRules), sizeof(__tag_TAVO_ROUTER_RULE)));
     if (rules.rgRules == nullptr) {
-        LogError("%s:%d malloc() failed", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d malloc() failed", kHopLinkFile, __LINE__);
         return -1;
     }
     int cRules = 0;
-    if (WriteRouterRules(&cRules, rules.rgRules, rules.nRules, rgRuleConfOpRules, nRuleConfOpRules) != 0 ||
-        WriteRouterRules(&cRules, rules.rgRules, rules.nRules, rgOpRules, nOpRules) != 0) {
-        LogError("%s:%d WriteRouterRules() failed", kHopLinkFile, __LINE__);
+    if (WriteRouterRules(host, &cRules, rules.rgRules, rules.nRules, rgRuleConfOpRules, nRuleConfOpRules) != 0 ||
+        WriteRouterRules(host, &cRules, rules.rgRules, rules.nRules, rgOpRules, nOpRules) != 0) {
+        host.LogError("%s:%d WriteRouterRules() failed", kHopLinkFile, __LINE__);
         return -1;
     }
     rules.MoveTo(pRgRules, pnRules);

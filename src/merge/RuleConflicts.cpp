@@ -25,21 +25,23 @@ Selection Select(const OPERATION_RULE& rule, const RULE_FILTER* pFilter) {
                                                                                           : Selection::Out;
 }
 
-bool CheckArguments(const OPERATION_RULE* rgOpRules1, int nOpRules1, const OPERATION_RULE* rgOpRules, int nOpRules) {
+bool CheckArguments(const MergeHost& host, const OPERATION_RULE* rgOpRules1, int nOpRules1,
+                    const OPERATION_RULE* rgOpRules, int nOpRules) {
     if (nOpRules1 < 0) {
-        LogError("%s:%d Bad parameter, 0 > nOpRules1=%d", kHopLinkFile, __LINE__, nOpRules1);
+        host.LogError("%s:%d Bad parameter, 0 > nOpRules1=%d", kHopLinkFile, __LINE__, nOpRules1);
         return false;
     }
     if (nOpRules1 > 0 && rgOpRules1 == nullptr) {
-        LogError("%s:%d Bad parameter, 0 < nOpRules1=%d, but rgOpRules1 is NULL", kHopLinkFile, __LINE__, nOpRules1);
+        host.LogError("%s:%d Bad parameter, 0 < nOpRules1=%d, but rgOpRules1 is NULL", kHopLinkFile, __LINE__,
+                      nOpRules1);
         return false;
     }
     if (nOpRules < 0) {
-        LogError("%s:%d Bad parameter, 0 > nOpRules=%d", kHopLinkFile, __LINE__, nOpRules);
+        host.LogError("%s:%d Bad parameter, 0 > nOpRules=%d", kHopLinkFile, __LINE__, nOpRules);
         return false;
     }
     if (nOpRules > 0 && rgOpRules == nullptr) {
-        LogError("%s:%d Bad parameter, 0 < nOpRules=%d, but rgOpRules is NULL", kHopLinkFile, __LINE__, nOpRules);
+        host.LogError("%s:%d Bad parameter, 0 < nOpRules=%d, but rgOpRules is NULL", kHopLinkFile, __LINE__, nOpRules);
         return false;
     }
     return true;
@@ -49,52 +51,68 @@ int Count(const PortList& ports) {
     return static_cast<int>(ports.size());
 }
 
-bool CheckLists(const OPERATION_RULE& rule, int i) {
+bool CheckLists(const MergeHost& host, const OPERATION_RULE& rule, int i, MergeObserver* pObserver) {
     if (rule.routerPortSet == nullptr) {
-        LogError("%s:%d rgOpRules1[%d].routerPortSet is NULL", kHopLinkFile, __LINE__, i);
+        host.LogError("%s:%d rgOpRules1[%d].routerPortSet is NULL", kHopLinkFile, __LINE__, i);
         return false;
     }
     if (rule.boxPortSet == nullptr) {
-        LogError("%s:%d rgOpRules1[%d].boxPortSet is NULL", kHopLinkFile, __LINE__, i);
+        host.LogError("%s:%d rgOpRules1[%d].boxPortSet is NULL", kHopLinkFile, __LINE__, i);
         return false;
     }
     if (rule.routerPortSet->size() != rule.boxPortSet->size()) {
-        LogError("%s:%d begin, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__,
-                 Count(*rule.routerPortSet), Count(*rule.boxPortSet));
+        host.LogError("%s:%d begin, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__,
+                      Count(*rule.routerPortSet), Count(*rule.boxPortSet));
+        if (pObserver != nullptr) {
+            pObserver->OnUneven(rule);
+        }
         return false;
     }
     if (rule.routerPortSet->empty()) {
-        LogError("%s:%d router port list size == 0", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d router port list size == 0", kHopLinkFile, __LINE__);
         return false;
     }
     return true;
 }
 
+// What a pass takes away, of what it finds where.
+struct Pass {
+    const MergeHost& host;
+    OpRulesSearch& search;
+    bool blDeleteFound;
+    MergeObserver* pObserver;  // may be null
+};
+
 // Whether one pair goes; nothing when that cannot be told.
-std::optional<bool> IsToGo(OpRulesSearch& search, int nRouterPort, int nBoxPort, PORTMAP_PROTOCOL protocol,
-                           bool blDeleteFound) {
+std::optional<bool> IsToGo(const Pass& pass, const OPERATION_RULE& rule, int nRouterPort, int nBoxPort) {
     auto enStatus = SearchStatus::Unknown;
-    if (search.IsPortInOpRules(nRouterPort, nBoxPort, protocol, &enStatus) != 0) {
-        LogError("%s:%d IsPortInOpRules() failed", kHopLinkFile, __LINE__);
+    const OPERATION_RULE* pDecider = nullptr;
+    if (pass.search.IsPortInOpRules(nRouterPort, nBoxPort, rule.protocol, &enStatus, &pDecider) != 0) {
+        pass.host.LogError("%s:%d IsPortInOpRules() failed", kHopLinkFile, __LINE__);
         return std::nullopt;
     }
     if (enStatus == SearchStatus::PartialMatched) {
-        LogError("%s:%d failed, port is partial matched", kHopLinkFile, __LINE__);
+        pass.host.LogError("%s:%d failed, port is partial matched", kHopLinkFile, __LINE__);
+        if (pass.pObserver != nullptr) {
+            pass.pObserver->OnTorn(rule, nRouterPort, nBoxPort, *pDecider);
+        }
         return std::nullopt;
     }
-    return (enStatus == SearchStatus::Found) == blDeleteFound;
+    const bool blToGo = (enStatus == SearchStatus::Found) == pass.blDeleteFound;
+    if (blToGo && pass.pObserver != nullptr) {
+        pass.pObserver->OnRemoved(rule, nRouterPort, nBoxPort, pDecider);
+    }
+    return blToGo;
 }
 
 // One rule of a pass.
-bool DeletePortsFromRule(OPERATION_RULE& rule, OpRulesSearch& search, bool blDeleteFound) {
-    if (!RemovePairs(rule, [&](int nRouterPort, int nBoxPort) {
-            return IsToGo(search, nRouterPort, nBoxPort, rule.protocol, blDeleteFound);
-        })) {
+bool DeletePortsFromRule(const Pass& pass, OPERATION_RULE& rule) {
+    if (!RemovePairs(rule, [&](int nRouterPort, int nBoxPort) { return IsToGo(pass, rule, nRouterPort, nBoxPort); })) {
         return false;
     }
     if (rule.routerPortSet->size() != rule.boxPortSet->size()) {
-        LogError("%s:%d end, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__,
-                 Count(*rule.routerPortSet), Count(*rule.boxPortSet));
+        pass.host.LogError("%s:%d end, router port numbers=%d != box port numbers=%d", kHopLinkFile, __LINE__,
+                           Count(*rule.routerPortSet), Count(*rule.boxPortSet));
         return false;
     }
     if (rule.routerPortSet->empty()) {
@@ -105,11 +123,12 @@ bool DeletePortsFromRule(OPERATION_RULE& rule, OpRulesSearch& search, bool blDel
 
 }  // namespace
 
-int IsNeedToFilterOut(bool* pblFilterOut, const OPERATION_RULE& rule, const RULE_FILTER* pFilter) {
+int IsNeedToFilterOut(const MergeHost& host, bool* pblFilterOut, const OPERATION_RULE& rule,
+                      const RULE_FILTER* pFilter) {
     const Selection selection = Select(rule, pFilter);
     if (selection == Selection::Unclear) {
-        LogError("%s:%d Bad parameter, blMatchEnabledRules and blMatchDisabledRules shall not both be false",
-                 kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, blMatchEnabledRules and blMatchDisabledRules shall not both be false",
+                      kHopLinkFile, __LINE__);
         return -1;
     }
     *pblFilterOut = selection == Selection::Out;
@@ -120,9 +139,15 @@ int IsNeedToFilterOut(bool* pblFilterOut, const OPERATION_RULE& rule, const RULE
 
 void OpRulesSearch::Places::Add(const PortList& ports, int nRule) {
     int nPosition = 0;
+    unsigned nPage = 0;
+    std::array<Place, kPageSize>* pPage = nullptr;  // neighbours are mostly on one
     for (const int nPort : ports) {
         const auto nKey = static_cast<unsigned>(nPort);
-        Place& place = mPages[nKey / kPageSize][nKey % kPageSize];
+        if (pPage == nullptr || nPage != nKey / kPageSize) {
+            nPage = nKey / kPageSize;
+            pPage = &mPages[nPage];
+        }
+        Place& place = (*pPage)[nKey % kPageSize];
         if (place.nRule == kNoRule) {
             place = {nRule, nPosition};
         }
@@ -164,11 +189,11 @@ int OpRulesSearch::Refuse(int nRule) const {
     const OPERATION_RULE& rule = mRgRules[nRule];
     bool blFilterOut = false;
     if (rule.routerPortSet == nullptr) {
-        LogError("%s:%d rgOpRules[%d].routerPortSet is NULL", kHopLinkFile, __LINE__, nRule);
+        mHost.LogError("%s:%d rgOpRules[%d].routerPortSet is NULL", kHopLinkFile, __LINE__, nRule);
     } else if (rule.boxPortSet == nullptr) {
-        LogError("%s:%d rgOpRules[%d].boxPortSet is NULL", kHopLinkFile, __LINE__, nRule);
-    } else if (IsNeedToFilterOut(&blFilterOut, rule, mPFilter) != 0) {
-        LogError("%s:%d IsNeedToFilterOut() rules2 failed", kHopLinkFile, __LINE__);
+        mHost.LogError("%s:%d rgOpRules[%d].boxPortSet is NULL", kHopLinkFile, __LINE__, nRule);
+    } else if (IsNeedToFilterOut(mHost, &blFilterOut, rule, mPFilter) != 0) {
+        mHost.LogError("%s:%d IsNeedToFilterOut() rules2 failed", kHopLinkFile, __LINE__);
     }
     return -1;
 }
@@ -183,13 +208,13 @@ SearchStatus OpRulesSearch::Judge(const Place& router, const Place& box) {
 }
 
 int OpRulesSearch::IsPortInOpRules(int nRouterPortNumber, int nBoxPortNumber, PORTMAP_PROTOCOL protocol,
-                                   SearchStatus* pStatus) {
+                                   SearchStatus* pStatus, const OPERATION_RULE** ppDecider) {
     if (nRouterPortNumber < 1) {
-        LogError("%s:%d Bad parameter, nRouterPortNumber=%d", kHopLinkFile, __LINE__, nRouterPortNumber);
+        mHost.LogError("%s:%d Bad parameter, nRouterPortNumber=%d", kHopLinkFile, __LINE__, nRouterPortNumber);
         return -1;
     }
     if (nBoxPortNumber < 1) {
-        LogError("%s:%d Bad parameter, nBoxPortNumber=%d", kHopLinkFile, __LINE__, nBoxPortNumber);
+        mHost.LogError("%s:%d Bad parameter, nBoxPortNumber=%d", kHopLinkFile, __LINE__, nBoxPortNumber);
         return -1;
     }
     if (!mBlIndexed) {
@@ -213,8 +238,9 @@ int OpRulesSearch::IsPortInOpRules(int nRouterPortNumber, int nBoxPortNumber, PO
         return Refuse(nObstacle);
     }
     *pStatus = Judge(router, box);
+    *ppDecider = nFirst == kNoRule ? nullptr : mRgRules + nFirst;
     if (*pStatus == SearchStatus::Unknown) {
-        LogError("%s:%d failed, search done but search status is unknown", kHopLinkFile, __LINE__);
+        mHost.LogError("%s:%d failed, search done but search status is unknown", kHopLinkFile, __LINE__);
         return -1;
     }
     return 0;
@@ -222,40 +248,43 @@ int OpRulesSearch::IsPortInOpRules(int nRouterPortNumber, int nBoxPortNumber, PO
 
 // ---- the passes -------------------------------------------------------------------------------------
 
-int DeletePortsFromRules1(OPERATION_RULE* rgOpRules1, int nOpRules1, const OPERATION_RULE* rgOpRules, int nOpRules,
-                          bool blDeleteFound, const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2) {
-    if (!CheckArguments(rgOpRules1, nOpRules1, rgOpRules, nOpRules)) {
+int DeletePortsFromRules1(const MergeHost& host, OPERATION_RULE* rgOpRules1, int nOpRules1,
+                          const OPERATION_RULE* rgOpRules, int nOpRules, bool blDeleteFound,
+                          const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2, MergeObserver* pObserver) {
+    if (!CheckArguments(host, rgOpRules1, nOpRules1, rgOpRules, nOpRules)) {
         return -1;
     }
-    OpRulesSearch search(rgOpRules, nOpRules, pFilter2);
+    OpRulesSearch search(host, rgOpRules, nOpRules, pFilter2);
+    const Pass pass{host, search, blDeleteFound, pObserver};
     for (int i = 0; i < nOpRules1; ++i) {
         OPERATION_RULE& rule = rgOpRules1[i];
         if (rule.blDeleted) {
             continue;
         }
         bool blFilterOut = false;
-        if (IsNeedToFilterOut(&blFilterOut, rule, pFilter1) != 0) {
-            LogError("%s:%d IsNeedToFilterOut() rules1 failed", kHopLinkFile, __LINE__);
+        if (IsNeedToFilterOut(host, &blFilterOut, rule, pFilter1) != 0) {
+            host.LogError("%s:%d IsNeedToFilterOut() rules1 failed", kHopLinkFile, __LINE__);
             return -1;
         }
         if (blFilterOut) {
             continue;
         }
-        if (!CheckLists(rule, i) || !DeletePortsFromRule(rule, search, blDeleteFound)) {
+        if (!CheckLists(host, rule, i, pObserver) || !DeletePortsFromRule(pass, rule)) {
             return -1;
         }
     }
     return 0;
 }
 
-int DeletePortsFromRuleConf(OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules, const char* szServiceName) {
+int DeletePortsFromRuleConf(const MergeHost& host, OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules,
+                            const char* szServiceName) {
     if (szServiceName == nullptr || szServiceName[0] == '\0') {
-        LogError("%s:%d Bad parameter, szServiceName shall not be empty", kHopLinkFile, __LINE__);
+        host.LogError("%s:%d Bad parameter, szServiceName shall not be empty", kHopLinkFile, __LINE__);
         return -1;
     }
     if (nRuleConfOpRules > 0 && rgRuleConfOpRules == nullptr) {
-        LogError("%s:%d Bad parameter, 0 < nRuleConfOpRules=%d but rgRuleConfOpRules is NULL", kHopLinkFile, __LINE__,
-                 nRuleConfOpRules);
+        host.LogError("%s:%d Bad parameter, 0 < nRuleConfOpRules=%d but rgRuleConfOpRules is NULL", kHopLinkFile,
+                      __LINE__, nRuleConfOpRules);
         return -1;
     }
     for (int i = 0; i < nRuleConfOpRules; ++i) {
@@ -267,24 +296,25 @@ int DeletePortsFromRuleConf(OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRu
     return 0;
 }
 
-int DeletePortsFromInputRules(OPERATION_RULE* rgOpRules, int nOpRules, OPERATION_RULE* rgRuleConfOpRules,
-                              int nRuleConfOpRules, const char* szServiceName) {
+int DeletePortsFromInputRules(const MergeHost& host, OPERATION_RULE* rgOpRules, int nOpRules,
+                              OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules, const char* szServiceName,
+                              MergeObserver* pObserver) {
     const RULE_FILTER filterA{szServiceName, false, true, false};  // what others map
     const RULE_FILTER filterB{szServiceName, true, false, true};   // what the user switched off for the service
     const RULE_FILTER filterC{nullptr, false, true, true};         // the whole request
-    if (DeletePortsFromRules1(rgRuleConfOpRules, nRuleConfOpRules, rgOpRules, nOpRules, false, &filterB, &filterC) !=
-        0) {
-        LogError("%s:%d DeletePortsFromRules1(B->C) failed", kHopLinkFile, __LINE__);
+    if (DeletePortsFromRules1(host, rgRuleConfOpRules, nRuleConfOpRules, rgOpRules, nOpRules, false, &filterB, &filterC,
+                              pObserver) != 0) {
+        host.LogError("%s:%d DeletePortsFromRules1(B->C) failed", kHopLinkFile, __LINE__);
         return -1;
     }
-    if (DeletePortsFromRules1(rgOpRules, nOpRules, rgRuleConfOpRules, nRuleConfOpRules, true, &filterC, &filterA) !=
-        0) {
-        LogError("%s:%d DeletePortsFromRules1(C->A) failed", kHopLinkFile, __LINE__);
+    if (DeletePortsFromRules1(host, rgOpRules, nOpRules, rgRuleConfOpRules, nRuleConfOpRules, true, &filterC, &filterA,
+                              pObserver) != 0) {
+        host.LogError("%s:%d DeletePortsFromRules1(C->A) failed", kHopLinkFile, __LINE__);
         return -1;
     }
-    if (DeletePortsFromRules1(rgOpRules, nOpRules, rgRuleConfOpRules, nRuleConfOpRules, true, &filterC, &filterB) !=
-        0) {
-        LogError("%s:%d DeletePortsFromRules1(C->B) failed", kHopLinkFile, __LINE__);
+    if (DeletePortsFromRules1(host, rgOpRules, nOpRules, rgRuleConfOpRules, nRuleConfOpRules, true, &filterC, &filterB,
+                              pObserver) != 0) {
+        host.LogError("%s:%d DeletePortsFromRules1(C->B) failed", kHopLinkFile, __LINE__);
         return -1;
     }
     return 0;

@@ -22,7 +22,8 @@ struct RULE_FILTER {
 
 // 0, or -1 for a rule that passes the test of its name and meets a filter that wants neither enabled nor
 // disabled rules.
-int IsNeedToFilterOut(bool* pblFilterOut, const OPERATION_RULE& rule, const RULE_FILTER* pFilter);
+int IsNeedToFilterOut(const MergeHost& host, bool* pblFilterOut, const OPERATION_RULE& rule,
+                      const RULE_FILTER* pFilter);
 
 enum class SearchStatus { Unknown, Found, NotFound, PartialMatched };
 
@@ -30,13 +31,15 @@ enum class SearchStatus { Unknown, Found, NotFound, PartialMatched };
 // every port stands first, so that a pass costs the sum of both sides' ports and not their product.
 class OpRulesSearch {
 public:
-    OpRulesSearch(const OPERATION_RULE* rgOpRules, int nOpRules, const RULE_FILTER* pFilter)
-        : mRgRules(rgOpRules), mNRules(rgOpRules == nullptr ? 0 : nOpRules), mPFilter(pFilter) {}
+    OpRulesSearch(const MergeHost& host, const OPERATION_RULE* rgOpRules, int nOpRules, const RULE_FILTER* pFilter)
+        : mHost(host), mRgRules(rgOpRules), mNRules(rgOpRules == nullptr ? 0 : nOpRules), mPFilter(pFilter) {}
 
     // What the first selected rule says that has either port: found where both stand first at the same
     // position, else partial matched. A "tcp" or "udp" pair is also looked for in rules for both protocols,
     // a pair for both only in rules for both. -1: a bad port, or a rule that cannot be judged comes first.
-    int IsPortInOpRules(int nRouterPortNumber, int nBoxPortNumber, PORTMAP_PROTOCOL protocol, SearchStatus* pStatus);
+    // *ppDecider becomes the rule that decided, null where none did.
+    int IsPortInOpRules(int nRouterPortNumber, int nBoxPortNumber, PORTMAP_PROTOCOL protocol, SearchStatus* pStatus,
+                        const OPERATION_RULE** ppDecider);
 
 private:
     static constexpr int kNoRule = INT_MAX;
@@ -65,6 +68,7 @@ private:
     static SearchStatus Judge(const Place& router, const Place& box);
     int Refuse(int nRule) const;
 
+    const MergeHost& mHost;
     const OPERATION_RULE* mRgRules;
     int mNRules;
     const RULE_FILTER* mPFilter;
@@ -76,23 +80,18 @@ private:
 // Takes the pairs out of rgOpRules1 (those that pFilter1 selects) that are found (blDeleteFound), or not
 // found, in rgOpRules (pFilter2), which must be another array. A rule that lost every pair is marked
 // deleted. A partial match is a failure; what was removed before a failure stays removed.
-int DeletePortsFromRules1(OPERATION_RULE* rgOpRules1, int nOpRules1, const OPERATION_RULE* rgOpRules, int nOpRules,
-                          bool blDeleteFound, const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2);
+int DeletePortsFromRules1(const MergeHost& host, OPERATION_RULE* rgOpRules1, int nOpRules1,
+                          const OPERATION_RULE* rgOpRules, int nOpRules, bool blDeleteFound,
+                          const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2, MergeObserver* pObserver = nullptr);
 
 // Marks the enabled rules of the service deleted: its new request replaces them.
-int DeletePortsFromRuleConf(OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules, const char* szServiceName);
+int DeletePortsFromRuleConf(const MergeHost& host, OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules,
+                            const char* szServiceName);
 
 // Disabled rules of the service keep what it still requests; the request loses what others' enabled
 // rules hold, then what the user switched off for the service.
-int DeletePortsFromInputRules(OPERATION_RULE* rgOpRules, int nOpRules, OPERATION_RULE* rgRuleConfOpRules,
-                              int nRuleConfOpRules, const char* szServiceName);
-
-// Appends the router's outside ports that enabled mappings of other hosts hold; asks a UPnP router.
-int GetUsedRouterPortList(PortList& tcpPorts, PortList& udpPorts);
-
-// Takes such ports out of the rules of the service (null: of all rules) in both arrays; a rule for both
-// protocols loses those that are taken for TCP. Nothing happens without the settings of a UPnP router.
-int DeleteConflictPortsForUPnPRouter(OPERATION_RULE* rgOpRules, int nOpRules, OPERATION_RULE* rgOpConfRules,
-                                     int nOpConfRules, const char* szServiceName);
+int DeletePortsFromInputRules(const MergeHost& host, OPERATION_RULE* rgOpRules, int nOpRules,
+                              OPERATION_RULE* rgRuleConfOpRules, int nRuleConfOpRules, const char* szServiceName,
+                              MergeObserver* pObserver = nullptr);
 
 }  // namespace tavo::lib

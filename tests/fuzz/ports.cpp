@@ -7,7 +7,7 @@
 #include <set>
 #include <string>
 
-#include "merge/OperationRules.h"
+#include "HopLink.h"
 
 namespace {
 
@@ -22,11 +22,12 @@ void Require(bool blHolds) {
     }
 }
 
-void CheckWritten(const std::list<int>& ports) {
+void CheckWritten(const std::list<int>& read) {
+    const tavo::lib::PortList ports(read.begin(), read.end());
     static char szWhole[kRoom];
-    Require(tavo::lib::ToPorts(szWhole, kRoom, ports) == 0);
+    Require(tavo::lib::ToPorts(tavo::lib::Host(), szWhole, kRoom, ports) == 0);
     char szCut[8];
-    Require(tavo::lib::ToPorts(szCut, sizeof(szCut), ports) == 0);
+    Require(tavo::lib::ToPorts(tavo::lib::Host(), szCut, sizeof(szCut), ports) == 0);
     Require(std::strncmp(szCut, szWhole, sizeof(szCut) - 1) == 0 && std::strlen(szCut) < sizeof(szCut));
     std::list<int> again;
     Require(TLibParsePorts(again, szWhole) == 0);

@@ -1,11 +1,11 @@
-"""Who may know whom: every file that a source was compiled from, as the compiler wrote it down, against a table; and
-what the platform's library shows against the seam. A folder that is not in the table, or is gone, fails too."""
+"""Who may know whom: every file that a source was compiled from, as the compiler wrote it down, against a table; what
+the platform's library shows against the seam; and that the merge asks nothing of either library. A folder that is not in the table, or is gone, fails too."""
 import os
 import re
 import subprocess
 import sys
 
-SOURCE, BUILD, PLATFORM, LIBRARY = (os.path.realpath(path) for path in sys.argv[1:5])
+SOURCE, BUILD, PLATFORM, LIBRARY, MERGE = (os.path.realpath(path) for path in sys.argv[1:6])
 SEAM = "platform/include/"
 GROUND = ["ground/", SEAM]
 WIRE = ["wire/", *GROUND]
@@ -14,13 +14,14 @@ MAPPING = ["mapping/", *GROUND]
 # The longest prefix counts.
 MAY_KNOW = {
     "src/": ["src/", "include/", SEAM],
+    "src/merge/": ["src/merge/", "include/libtavoportmap.h"],
     "platform/linux/": ["platform/linux/", *WIRE],
     "ground/": GROUND,
     "wire/": WIRE,
     "mapping/": MAPPING,
     "mapping/Plan.cpp": ["mapping/", "ground/Marks.h"],
     "programs/": ["programs/common/", *WIRE, *MAPPING],
-    "cli/": ["cli/", "include/", SEAM],
+    "cli/": ["cli/", "include/", "src/merge/", SEAM],
     "tests/": [""],
     "bench/": [""],
 }
@@ -84,6 +85,13 @@ def broken_seam():
                 for name in names(LIBRARY, "--undefined-only") & seam - shown)
 
 
-faults = sorted({*broken_layers(), *broken_seam()})
+def broken_merge():
+    """What the records' header declares beside the records is out of its reach."""
+    for line in subprocess.check_output(["nm", "-uC", MERGE], text=True).splitlines():
+        if re.match(r"\s+U (TLIB|TLib|TAVO|TestFunc|syslog)", line):
+            yield f"the merge asks for {line.split()[1]} itself, and not its host"
+
+
+faults = sorted({*broken_layers(), *broken_seam(), *broken_merge()})
 print("\n".join(faults) or "every file knows only what it may")
 sys.exit(bool(faults))

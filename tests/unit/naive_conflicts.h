@@ -3,8 +3,11 @@
 #pragma once
 
 #include <algorithm>
+#include <list>
+#include <string>
 
-#include "merge/RuleConflicts.h"
+#include "HopLink.h"
+#include "src/merge/RuleConflicts.h"
 
 namespace naive {
 
@@ -42,7 +45,7 @@ inline int Search(int nRouter, int nBox, PORTMAP_PROTOCOL protocol, const OPERAT
             continue;
         }
         bool blFilterOut = false;
-        if (IsNeedToFilterOut(&blFilterOut, rule, pFilter) != 0) {
+        if (IsNeedToFilterOut(Host(), &blFilterOut, rule, pFilter) != 0) {
             return Fail("IsNeedToFilterOut() rules2 failed");
         }
         const int nAtRouter = blFilterOut ? -1 : PositionOf(*rule.routerPortSet, nRouter);
@@ -55,17 +58,15 @@ inline int Search(int nRouter, int nBox, PORTMAP_PROTOCOL protocol, const OPERAT
     return 0;
 }
 
-inline int Walk(OPERATION_RULE& rule, const OPERATION_RULE* rgRules, int nRules, bool blDeleteFound,
-                const RULE_FILTER* pFilter) {
-    PortList& router = *rule.routerPortSet;
-    PortList& box = *rule.boxPortSet;
+inline int WalkLists(std::list<int>& router, std::list<int>& box, PORTMAP_PROTOCOL protocol,
+                     const OPERATION_RULE* rgRules, int nRules, bool blDeleteFound, const RULE_FILTER* pFilter) {
     auto itRouter = router.end();
     auto itBox = box.end();
     for (size_t nLeft = router.size(); nLeft > 0; --nLeft) {
         --itRouter;
         --itBox;
         SearchStatus enStatus{};
-        if (Search(*itRouter, *itBox, rule.protocol, rgRules, nRules, pFilter, enStatus) != 0) {
+        if (Search(*itRouter, *itBox, protocol, rgRules, nRules, pFilter, enStatus) != 0) {
             return Fail("IsPortInOpRules() failed");
         }
         if (enStatus == SearchStatus::PartialMatched) {
@@ -76,16 +77,27 @@ inline int Walk(OPERATION_RULE& rule, const OPERATION_RULE* rgRules, int nRules,
             itBox = box.erase(itBox);
         }
     }
-    rule.blDeleted = router.empty();
     return 0;
 }
 
-inline int DeletePortsFromRules1(OPERATION_RULE* rgRules1, int nRules1, const OPERATION_RULE* rgRules, int nRules,
-                                 bool blDeleteFound, const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2) {
+inline int Walk(OPERATION_RULE& rule, const OPERATION_RULE* rgRules, int nRules, bool blDeleteFound,
+                const RULE_FILTER* pFilter) {
+    std::list<int> router(rule.routerPortSet->begin(), rule.routerPortSet->end());
+    std::list<int> box(rule.boxPortSet->begin(), rule.boxPortSet->end());
+    const int nResult = WalkLists(router, box, rule.protocol, rgRules, nRules, blDeleteFound, pFilter);
+    *rule.routerPortSet = PortList(router.begin(), router.end());
+    *rule.boxPortSet = PortList(box.begin(), box.end());
+    rule.blDeleted = nResult == 0 && router.empty();
+    return nResult;
+}
+inline int DeletePortsFromRules1(const MergeHost& /*host*/, OPERATION_RULE* rgRules1, int nRules1,
+                                 const OPERATION_RULE* rgRules, int nRules, bool blDeleteFound,
+                                 const RULE_FILTER* pFilter1, const RULE_FILTER* pFilter2,
+                                 MergeObserver* /*pObserver*/ = nullptr) {
     for (int i = 0; i < nRules1; ++i) {
         OPERATION_RULE& rule = rgRules1[i];
         bool blFilterOut = rule.blDeleted;
-        if (!blFilterOut && IsNeedToFilterOut(&blFilterOut, rule, pFilter1) != 0) {
+        if (!blFilterOut && IsNeedToFilterOut(Host(), &blFilterOut, rule, pFilter1) != 0) {
             return Fail("IsNeedToFilterOut() rules1 failed");
         }
         if (blFilterOut) {

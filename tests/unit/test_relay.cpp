@@ -52,14 +52,14 @@ TEST_F(Relay, PortListsAreReadInTheirOrder) {
     };
     for (const auto& c : rgCases) {
         gLog.clear();
-        Ports ports = {1};
+        std::list<int> ports = {1};
         EXPECT_EQ(TLibParsePorts(ports, c.szText), *c.szLine == '\0' ? 0 : -1) << c.szText;
         EXPECT_EQ(ports.front(), 1);
         ports.pop_front();
-        EXPECT_EQ(ports, c.ports) << c.szText;
+        EXPECT_EQ(Ports(ports.begin(), ports.end()), c.ports) << c.szText;
         EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
     }
-    Ports ports;
+    std::list<int> ports;
     EXPECT_EQ(TLibParsePorts(ports, nullptr), -1);
     EXPECT_TRUE(Logged("Bad parameter, NULL == szPort"));
     EXPECT_EQ(TLibParsePorts(ports, "1-65535"), 0);
@@ -86,11 +86,11 @@ TEST_F(Relay, PortListsAreWrittenAsRuns) {
     for (const auto& c : rgCases) {
         gLog.clear();
         char szOut[1024] = "kept";
-        EXPECT_EQ(ToPorts(szOut, c.nSize, c.ports), *c.szLine == '\0' ? 0 : -1) << c.szText;
+        EXPECT_EQ(ToPorts(Host(), szOut, c.nSize, c.ports), *c.szLine == '\0' ? 0 : -1) << c.szText;
         EXPECT_STREQ(szOut, c.szText);
         EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
     }
-    EXPECT_EQ(ToPorts(nullptr, 5, {}), -1);
+    EXPECT_EQ(ToPorts(Host(), nullptr, 5, {}), -1);
     EXPECT_TRUE(Logged("Bad parameter, szOutPorts is NULL"));
     char szOut[8] = "kept";
     EXPECT_EQ(TestFuncToPorts(szOut, 8, "1,2,3,7"), 0);
@@ -113,7 +113,7 @@ TEST_F(Relay, RequestsBecomeRules) {
     const __tag_TAVO_PORTMAP_RULE rgRequests[] = {Request("5000-5001", 0), Request("7,6", 9)};
     for (const auto& [szName, szId] : {std::pair("hoplink", "HopLink"), std::pair("HopLink", "")}) {
         OperationRules rules;
-        ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, szName, rgRequests, 2), 0);
+        ASSERT_EQ(CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, szName, rgRequests, 2), 0);
         ASSERT_EQ(rules.nRules, 2);
         EXPECT_TRUE(rules.rgRules[0].blEnable);
         EXPECT_EQ(*rules.rgRules[0].routerPortSet, Ports({5000, 5001}));
@@ -125,16 +125,16 @@ TEST_F(Relay, RequestsBecomeRules) {
     OPERATION_RULE* pOut = nullptr;
     int nOut = 7;
     const __tag_TAVO_PORTMAP_RULE rgBad[] = {Request("1", 0), Request("0", 0)};
-    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", rgBad, 2), -1);
-    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, nullptr, rgBad, 2), -1);
-    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", rgBad, -1), -1);
-    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", nullptr, 1), -1);
+    EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, "x", rgBad, 2), -1);
+    EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, nullptr, rgBad, 2), -1);
+    EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, "x", rgBad, -1), -1);
+    EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, "x", nullptr, 1), -1);
     EXPECT_EQ(pOut, nullptr);
     EXPECT_EQ(nOut, 0);
     EXPECT_EQ(gLog, Lines({"invalid port no [0]", "TLibParsePorts() for routerPort failed",
                            "Bad parameter, szServiceName is NULL", "Bad parameter, 0 > nRules=-1",
                            "Bad parameter, nRules=1 >0, but rgRules is NULL"}));
-    EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, "x", nullptr, 0), 0);
+    EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, "x", nullptr, 0), 0);
 }
 
 __tag_TAVO_ROUTER_RULE Stored(const char* szProtocol, const char* szRouter, const char* szBox, const char* szService,
@@ -153,11 +153,11 @@ TEST_F(Relay, StoredRulesComeBackRenumbered) {
     const __tag_TAVO_ROUTER_RULE rgStored[] = {Stored("udp", "1,2,3", "7,8,9", "web", false),
                                                Stored("all", "5", "5", "", true), Stored("tcp", "6", "6", "", true)};
     OperationRules rules;
-    ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, rgStored, 3), 0);
+    ASSERT_EQ(CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, rgStored, 3), 0);
     rules.rgRules[1].blDeleted = true;
     {
         RouterRules back;
-        ASSERT_EQ(CreateRulesArray(&back.rgRules, &back.nRules, rules.rgRules, 3, rules.rgRules, 1), 0);
+        ASSERT_EQ(CreateRulesArray(Host(), &back.rgRules, &back.nRules, rules.rgRules, 3, rules.rgRules, 1), 0);
         ASSERT_EQ(back.nRules, 3);
         EXPECT_STREQ(back.rgRules[0].szRouterPort, "1-3");
         EXPECT_STREQ(back.rgRules[0].szSrcPort, "7-9");
@@ -170,16 +170,16 @@ TEST_F(Relay, StoredRulesComeBackRenumbered) {
         EXPECT_STREQ(back.rgRules[2].szRuleID, "3");
     }
     RouterRules none;
-    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 0, rules.rgRules + 1, 1), 0);
+    EXPECT_EQ(CreateRulesArray(Host(), &none.rgRules, &none.nRules, nullptr, 0, rules.rgRules + 1, 1), 0);
     EXPECT_EQ(none.rgRules, nullptr);
-    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 1, nullptr, 0), -1);
-    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, nullptr, 0, nullptr, 1), -1);
+    EXPECT_EQ(CreateRulesArray(Host(), &none.rgRules, &none.nRules, nullptr, 1, nullptr, 0), -1);
+    EXPECT_EQ(CreateRulesArray(Host(), &none.rgRules, &none.nRules, nullptr, 0, nullptr, 1), -1);
     rules.rgRules[2].routerPortSet->push_back(0);
-    EXPECT_EQ(CreateRulesArray(&none.rgRules, &none.nRules, rules.rgRules, 3, nullptr, 0), -1);
+    EXPECT_EQ(CreateRulesArray(Host(), &none.rgRules, &none.nRules, rules.rgRules, 3, nullptr, 0), -1);
     EXPECT_EQ(none.nRules, 0);
     int cRules = 1;
     __tag_TAVO_ROUTER_RULE rgRoom[1];
-    EXPECT_EQ(WriteRouterRules(&cRules, rgRoom, 1, rules.rgRules, 1), -1);
+    EXPECT_EQ(WriteRouterRules(Host(), &cRules, rgRoom, 1, rules.rgRules, 1), -1);
     EXPECT_EQ(gLog, Lines({"Bad parameter, 0 < nRuleConfOpRules=1, but rgRuleConfOpRules is NULL",
                            "Bad parameter, 0 < nOpRules=1, but rgOpRules is NULL", "TAVOPFIsValidPortNo(0) failed",
                            "ToPorts() failed", "WriteRouterRules() failed", "out of range, cRules=1 >= nRules=1"}));
@@ -198,7 +198,7 @@ TEST_F(Relay, StoredRulesThatCannotBeRead) {
         gLog.clear();
         OPERATION_RULE* pOut = nullptr;
         int nOut = 7;
-        EXPECT_EQ(CreateOperationRulesArray(&pOut, &nOut, &c.rule, 1), -1);
+        EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, &c.rule, 1), -1);
         EXPECT_EQ(gLog, c.lines);
         EXPECT_EQ(pOut, nullptr);
         EXPECT_EQ(nOut, 0);
@@ -215,7 +215,7 @@ TEST_F(Relay, MemoryThatRunsOutLeavesNoArray) {
         int nOut = 7;
         gBlAllocationFailed = false;
         gNGoodAllocations = nGood;
-        const int nResult = CreateOperationRulesArray(&pOut, &nOut, rgStored, 2);
+        const int nResult = CreateOperationRulesArray(Host(), &pOut, &nOut, rgStored, 2);
         gNGoodAllocations = -1;
         blFailed = gBlAllocationFailed;
         EXPECT_EQ(nResult, blFailed ? -1 : 0) << nGood;
@@ -241,15 +241,15 @@ TEST_F(Relay, WhatDoesNotFitARule) {
         const __tag_TAVO_PORTMAP_RULE request = Request(szText.c_str(), 0);
         OperationRules rules;
         RouterRules back;
-        ASSERT_EQ(CreateOperationRulesArray(&rules.rgRules, &rules.nRules, szName.c_str(), &request, 1), 0);
-        ASSERT_EQ(CreateRulesArray(&back.rgRules, &back.nRules, rules.rgRules, 1, nullptr, 0), 0);
+        ASSERT_EQ(CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, szName.c_str(), &request, 1), 0);
+        ASSERT_EQ(CreateRulesArray(Host(), &back.rgRules, &back.nRules, rules.rgRules, 1, nullptr, 0), 0);
         EXPECT_EQ(strlen(back.rgRules->szRouterPort), nWritten);
         EXPECT_STREQ(back.rgRules->szSrcPort, back.rgRules->szRouterPort);
         EXPECT_EQ(gLog, lines);
         // Under the same long name the service still finds its rules.
-        EXPECT_EQ(DeletePortsFromRuleConf(rules.rgRules, 1, szName.substr(0, 1022).c_str()), 0);
+        EXPECT_EQ(DeletePortsFromRuleConf(Host(), rules.rgRules, 1, szName.substr(0, 1022).c_str()), 0);
         EXPECT_FALSE(rules.rgRules->blDeleted);
-        EXPECT_EQ(DeletePortsFromRuleConf(rules.rgRules, 1, szName.c_str()), 0);
+        EXPECT_EQ(DeletePortsFromRuleConf(Host(), rules.rgRules, 1, szName.c_str()), 0);
         EXPECT_TRUE(rules.rgRules->blDeleted);
     }
 }
@@ -270,7 +270,7 @@ struct Set : OperationRules {
                                       szPorts.substr(nArrow + 1).c_str(), szService == "-" ? "" : szService.c_str(),
                                       szEnable == "E"));
         }
-        CreateOperationRulesArray(&rgRules, &nRules, rgStored.data(), static_cast<int>(rgStored.size()));
+        CreateOperationRulesArray(Host(), &rgRules, &nRules, rgStored.data(), static_cast<int>(rgStored.size()));
     }
     // What is not deleted, in the same form.
     std::string Kept() const {
@@ -279,13 +279,13 @@ struct Set : OperationRules {
             const OPERATION_RULE& rule = rgRules[i];
             char szRouter[1024] = {};
             char szBox[1024] = {};
-            if (rule.blDeleted || ToPorts(szRouter, 1024, *rule.routerPortSet) != 0 ||
-                ToPorts(szBox, 1024, *rule.boxPortSet) != 0) {
+            if (rule.blDeleted || ToPorts(Host(), szRouter, 1024, *rule.routerPortSet) != 0 ||
+                ToPorts(Host(), szBox, 1024, *rule.boxPortSet) != 0) {
                 continue;
             }
             szKept += szKept.empty() ? "" : "; ";
             szKept += rule.blEnable ? "E " : "D ";
-            szKept += ToProtocolString(rule.protocol) + std::string(" ") + szRouter + ">" + szBox;
+            szKept += ToProtocolString(Host(), rule.protocol) + std::string(" ") + szRouter + ">" + szBox;
         }
         return szKept;
     }
@@ -371,15 +371,15 @@ TEST_F(Relay, WhoKeepsAPort) {
         gLog.clear();
         Set request(c.szRequest);
         Set conf(c.szConf);
-        EXPECT_EQ(DeletePortsFromRuleConf(conf.rgRules, conf.nRules, "hop"), 0);
-        EXPECT_EQ(DeletePortsFromInputRules(request.rgRules, request.nRules, conf.rgRules, conf.nRules, "hop"),
+        EXPECT_EQ(DeletePortsFromRuleConf(Host(), conf.rgRules, conf.nRules, "hop"), 0);
+        EXPECT_EQ(DeletePortsFromInputRules(Host(), request.rgRules, request.nRules, conf.rgRules, conf.nRules, "hop"),
                   c.lines.empty() ? 0 : -1)
             << c.szWhat;
         EXPECT_EQ(request.Kept(), c.szRequestKept) << c.szWhat;
         EXPECT_EQ(conf.Kept(), c.szConfKept) << c.szWhat;
         EXPECT_EQ(gLog, c.lines) << c.szWhat;
     }
-    EXPECT_EQ(DeletePortsFromRuleConf(nullptr, 0, ""), -1);
+    EXPECT_EQ(DeletePortsFromRuleConf(Host(), nullptr, 0, ""), -1);
     EXPECT_TRUE(Logged("Bad parameter, szServiceName shall not be empty"));
 }
 
@@ -398,11 +398,11 @@ TEST_F(Relay, RefusedArgumentsOfAPass) {
     };
     for (const auto& c : rgCases) {
         gLog.clear();
-        EXPECT_EQ(DeletePortsFromRules1(c.pRules1, c.nRules1, nullptr, c.nRules, true, nullptr, nullptr), -1);
+        EXPECT_EQ(DeletePortsFromRules1(Host(), c.pRules1, c.nRules1, nullptr, c.nRules, true, nullptr, nullptr), -1);
         EXPECT_EQ(gLog, Lines({c.szLine}));
     }
     gLog.clear();
-    EXPECT_EQ(DeletePortsFromRules1(nullptr, 0, nullptr, 0, true, nullptr, nullptr), 0);
+    EXPECT_EQ(DeletePortsFromRules1(Host(), nullptr, 0, nullptr, 0, true, nullptr, nullptr), 0);
     EXPECT_TRUE(gLog.empty());
 }
 
@@ -423,7 +423,7 @@ TEST_F(Relay, WhichRulesAFilterLeavesIn) {
         std::string szOut;
         for (int i = 0; i < rules.nRules; ++i) {
             bool blOut = false;
-            const int nResult = IsNeedToFilterOut(&blOut, rules.rgRules[i], &c.filter);
+            const int nResult = IsNeedToFilterOut(Host(), &blOut, rules.rgRules[i], &c.filter);
             szOut += nResult == -1 ? 'x' : blOut ? '1' : '0';
         }
         EXPECT_EQ(szOut, c.szOut);
@@ -433,7 +433,7 @@ TEST_F(Relay, WhichRulesAFilterLeavesIn) {
                               "false"));
     }
     bool blOut = true;
-    EXPECT_EQ(IsNeedToFilterOut(&blOut, rules.rgRules[0], nullptr), 0);
+    EXPECT_EQ(IsNeedToFilterOut(Host(), &blOut, rules.rgRules[0], nullptr), 0);
     EXPECT_FALSE(blOut);
 }
 
@@ -516,11 +516,12 @@ TEST_F(Relay, TheIndexedSearchAnswersAsTheWalkDoes) {
         const bool blDeleteFound = random.OneIn(2);
         gLog.clear();
         const size_t nBefore = CountPorts(rules1);
-        const int nExpected = naive::DeletePortsFromRules1(rules1Copy.rgRules, rules1Copy.nRules, rulesCopy.rgRules,
-                                                           rulesCopy.nRules, blDeleteFound, pFilter1, pFilter2);
+        const int nExpected =
+            naive::DeletePortsFromRules1(Host(), rules1Copy.rgRules, rules1Copy.nRules, rulesCopy.rgRules,
+                                         rulesCopy.nRules, blDeleteFound, pFilter1, pFilter2);
         const Lines expected = gLog;
         gLog.clear();
-        ASSERT_EQ(tavo::lib::DeletePortsFromRules1(rules1.rgRules, rules1.nRules, rules.rgRules, rules.nRules,
+        ASSERT_EQ(tavo::lib::DeletePortsFromRules1(Host(), rules1.rgRules, rules1.nRules, rules.rgRules, rules.nRules,
                                                    blDeleteFound, pFilter1, pFilter2),
                   nExpected)
             << nSeed;

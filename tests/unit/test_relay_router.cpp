@@ -2,8 +2,9 @@
 // diagnostics' printed forms. The router's table and the box's interfaces are stand-ins.
 #include <gtest/gtest.h>
 
+#include "HopLink.h"
 #include "InitState.h"
-#include "merge/RuleConflicts.h"
+#include "RouterConflicts.h"
 #include "network.h"
 #include "world.h"
 
@@ -92,10 +93,10 @@ protected:
         FillText(request.szPorts, szPorts);
         request.enProtocol = nProtocol;
         OperationRules rules;
-        CreateOperationRulesArray(&rules.rgRules, &rules.nRules, "hop", &request, 1);
+        CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, "hop", &request, 1);
         EXPECT_EQ(DeleteConflictPortsForUPnPRouter(nullptr, 0, rules.rgRules, 1, "hop"), nExpected);
         char szLeft[TAVO_TEXT_SIZE] = {};
-        ToPorts(szLeft, TAVO_TEXT_SIZE, *rules.rgRules->routerPortSet);
+        ToPorts(Host(), szLeft, TAVO_TEXT_SIZE, *rules.rgRules->routerPortSet);
         EXPECT_EQ(*rules.rgRules->routerPortSet, *rules.rgRules->boxPortSet);
         EXPECT_EQ(rules.rgRules->blDeleted, rules.rgRules->routerPortSet->empty());
         return szLeft;
@@ -122,8 +123,8 @@ TEST_F(RelayRouter, OtherHostsMappingsWin) {
 TEST_F(RelayRouter, OnlyTheServicesRulesAndDeletedOnesToo) {
     __tag_TAVO_PORTMAP_RULE request = {0, "5000,5001", 0};
     OperationRules mine, others;
-    CreateOperationRulesArray(&mine.rgRules, &mine.nRules, "hop", &request, 1);
-    CreateOperationRulesArray(&others.rgRules, &others.nRules, "web", &request, 1);
+    CreateOperationRulesArray(Host(), &mine.rgRules, &mine.nRules, "hop", &request, 1);
+    CreateOperationRulesArray(Host(), &others.rgRules, &others.nRules, "web", &request, 1);
     mine.rgRules->blDeleted = true;
     EXPECT_EQ(DeleteConflictPortsForUPnPRouter(mine.rgRules, 1, others.rgRules, 1, "hop"), 0);
     EXPECT_EQ(mine.rgRules->routerPortSet->size(), 1U);

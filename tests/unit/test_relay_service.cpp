@@ -5,7 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "merge/OperationRules.h"
+#include "HopLink.h"
 #include "network.h"
 #include "stage.h"
 #include "tavo/core.h"
@@ -70,7 +70,8 @@ Requests Ask(const std::string& szRequests) {
     std::istringstream words(szRequests);
     for (std::string szWord; words >> szWord;) {
         const size_t nSlash = szWord.find('/');
-        Request request = {kUntouched, "", tavo::lib::ToProtocolEnum(szWord.substr(nSlash + 1).c_str())};
+        Request request = {kUntouched, "",
+                           tavo::lib::ToProtocolEnum(tavo::lib::Host(), szWord.substr(nSlash + 1).c_str())};
         tavo::lib::FillText(request.szPorts, szWord.substr(0, nSlash));
         rgRequests.push_back(request);
     }
