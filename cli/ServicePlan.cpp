@@ -1,15 +1,14 @@
-// Plays the merge of a service's request with the stored rules. Relies on TLibParsePorts. Promises: see
-// ServicePlan.h. A set is searched in rule order, and the first rule that has either port of a pair decides.
+// Runs the merge of a service's request with the stored rules, and puts into words what it sees. Relies on the merge.
+// Promises: see ServicePlan.h.
 #include "ServicePlan.h"
 
 #include <fmt/format.h>
 
-#include <algorithm>
-#include <climits>
-#include <functional>
-#include <list>
 #include <map>
-#include <optional>
+#include <new>
+
+#include "src/merge/RuleConflicts.h"
+#include "tavo/portforward.h"
 
 namespace tavo::cli {
 
@@ -17,145 +16,72 @@ const std::vector<std::string> kProtocolWords = {"tcp", "udp", "all"};
 
 namespace {
 
-constexpr int kAll = 2;
+using lib::OPERATION_RULE;
+using lib::PortList;
+using Records = std::vector<__tag_TAVO_ROUTER_RULE>;
+
 constexpr size_t kPorts = 65536;
-constexpr char kHopLink[] = "hoplink";
+constexpr char kNoLongerAsked[] = "the service no longer asks for it";
+constexpr char kHeldByOther[] = "another host holds it on the router";
 
-using Ports = std::vector<int>;
-
-// A rule with its ports taken apart; the n-th router port goes with the n-th box port.
-struct OpenRule {
-    Rule rule;
-    int enProtocol = 0;
-    Ports rgRouter = {};
-    Ports rgBox = {};
-    std::vector<std::string> rgszGone = {};  // why a pair is out; empty: it is still in
-    bool blDeleted = false;
-
-    bool IsIn(size_t nPair) const { return nPair >= rgszGone.size() || rgszGone[nPair].empty(); }
-    bool IsPaired() const { return rgRouter.size() == rgBox.size(); }
-    bool IsEmpty() const {
-        return std::none_of(rgszGone.begin(), rgszGone.end(), [](const std::string& szWhy) { return szWhy.empty(); });
-    }
-};
-
-using OpenRules = std::vector<OpenRule>;
-using Filter = std::function<bool(const OpenRule&)>;
-
-std::optional<Ports> TakeApart(const char* szPorts) {
-    std::list<int> ports;
-    return TLibParsePorts(ports, szPorts) == 0 ? std::optional(Ports(ports.begin(), ports.end())) : std::nullopt;
-}
-
-std::string NameOf(const Rule& rule) {
-    return Clean(rule.szId) + (rule.szName.empty() ? "" : fmt::format(" ({})", Clean(rule.szName)));
-}
-
-// As the library writes a list: runs of neighbours, rising or falling, are shortened.
-std::string ToText(const Ports& rgPorts) {
-    std::string szText;
-    for (size_t i = 0; i < rgPorts.size();) {
-        size_t nLast = i;
-        while (nLast + 1 < rgPorts.size() && std::abs(rgPorts[nLast + 1] - rgPorts[nLast]) == 1) {
-            ++nLast;
-        }
-        szText += fmt::format("{}{}", szText.empty() ? "" : ", ", rgPorts[i]);
-        szText += nLast > i ? fmt::format("-{}", rgPorts[nLast]) : "";
-        i = nLast + 1;
-    }
-    return szText;
-}
-
-// A list in its field of a rule; true when it was cut.
-bool Cut(std::string& szPorts) {
-    const bool blCut = szPorts.size() >= TAVO_TEXT_SIZE;
-    szPorts.resize(std::min<size_t>(szPorts.size(), TAVO_TEXT_SIZE - 1));
-    return blCut;
-}
-
-// ---- the search -----------------------------------------------------------------------------------------
-
-// Where a set first has each port, for the pairs of one protocol.
-class Places {
+// What the library would log is said by the plan.
+class QuietHost : public lib::MergeHost {
 public:
-    Places(const OpenRules& rules, int enProtocol, const Filter& fnSelect) {
-        for (size_t nRule = 0; nRule < rules.size(); ++nRule) {
-            const OpenRule& rule = rules[nRule];
-            // One-sided: a pair of both protocols meets only rules of both.
-            if (!rule.blDeleted && (rule.enProtocol == enProtocol || rule.enProtocol == kAll) && fnSelect(rule)) {
-                Book(mRgRouter, rule, rule.rgRouter, nRule);
-                Book(mRgBox, rule, rule.rgBox, nRule);
-            }
-        }
-    }
-
-    // The rule that decides over a pair, and whether it has it as a pair; nothing when none has either port.
-    std::optional<std::pair<size_t, bool>> Find(int nRouterPort, int nBoxPort) const {
-        const Place& router = mRgRouter[static_cast<size_t>(nRouterPort)];
-        const Place& box = mRgBox[static_cast<size_t>(nBoxPort)];
-        if (router.nRule == kNone && box.nRule == kNone) {
-            return std::nullopt;
-        }
-        return std::pair(std::min(router.nRule, box.nRule), router.nRule == box.nRule && router.nPair == box.nPair);
-    }
+    bool IsValidPortNo(int nPort) const override { return TAVOPFIsValidPortNo(nPort) != 0; }
 
 private:
-    static constexpr size_t kNone = SIZE_MAX;
-    struct Place {
-        size_t nRule = kNone;
-        size_t nPair = 0;
-    };
-
-    static void Book(std::vector<Place>& rgPlaces, const OpenRule& rule, const Ports& rgPorts, size_t nRule) {
-        for (size_t nPair = 0; nPair < rgPorts.size(); ++nPair) {
-            Place& place = rgPlaces[static_cast<size_t>(rgPorts[nPair])];
-            if (place.nRule == kNone && rule.IsIn(nPair)) {
-                place = {nRule, nPair};
-            }
-        }
-    }
-
-    std::vector<Place> mRgRouter = std::vector<Place>(kPorts);
-    std::vector<Place> mRgBox = std::vector<Place>(kPorts);
+    void Log(const char* /*szFormat*/, va_list /*arguments*/) const override {}
 };
 
-// ---- the merge ------------------------------------------------------------------------------------------
+std::string NameOf(const __tag_TAVO_ROUTER_RULE& record) {
+    const std::string szName = record.szServiceName;
+    return Clean(record.szRuleID) + (szName.empty() ? "" : fmt::format(" ({})", Clean(szName)));
+}
 
-class Merge {
+// Ports of one rule that go for one reason.
+struct Gone {
+    PortList ports;
+    std::string szWhy;
+};
+
+// One request, from the records to what would be in rule.conf.
+class Merge : public lib::MergeObserver {
 public:
-    explicit Merge(const std::string& szService) : mSzService(szService) {}
+    Merge(const std::string& szService, const Requests& rgRequests, const Records& rgStored)
+        : mSzService(szService), mRgRequests(rgRequests), mRgStored(rgStored) {}
 
-    // Each step answers whether to go on.
-    bool TakeStored(const std::vector<__tag_TAVO_ROUTER_RULE>& rgStored);
-    bool TakeRequests(const Requests& rgRequests);
-    void DropOwn();
-    bool RunPasses();
-    bool YieldToOthers(const UsedPorts& used);
+    ServicePlan Run(const std::optional<UsedPorts>& used);
+
+    void OnRemoved(const OPERATION_RULE& rule, int nRouterPort, int nBoxPort, const OPERATION_RULE* pDecider) override;
+    void OnTorn(const OPERATION_RULE& rule, int nRouterPort, int nBoxPort, const OPERATION_RULE& decider) override;
+    void OnUneven(const OPERATION_RULE& rule) override;
+
+private:
     ServicePlan Conclude() const;
-
-private:
-    // One pass: which pairs of which rules go, by what is found of them where.
-    struct Pass {
-        OpenRules& rules;
-        Filter fnSelect;
-        const OpenRules& others;
-        Filter fnSelectOthers;
-        bool blGoesWhenFound;
-        std::function<std::string(const OpenRule&)> fnWhy;  // of the rule that it was found in
-    };
-
-    bool IsOwn(const OpenRule& rule) const { return rule.rule.szName == mSzService; }
-    bool Run(const Pass& pass);
-    bool RunRule(const Pass& pass, OpenRule& rule, const Places& places);
+    bool Build();
+    bool RunPasses(const std::optional<UsedPorts>& used);
     bool Refuse(const std::string& szWhy);
-    bool YieldRules(OpenRules& rules, const UsedPorts& used);
-    void DescribeRequest(const OpenRule& rule, ServicePlan& plan) const;
-    void DescribeStored(const OpenRule& rule, ServicePlan& plan) const;
-    static void Append(const OpenRules& rules, ServicePlan& plan);
+    // The record that a rule was made from; null for a request.
+    const __tag_TAVO_ROUTER_RULE* RecordOf(const OPERATION_RULE& rule) const;
+    std::string WhyGone(const OPERATION_RULE* pDecider) const;
+    std::vector<Gone> FatesOf(const OPERATION_RULE& rule, const PortList& before) const;
+    std::string ToText(const PortList& ports) const { return lib::ToText(mHost, ports).value_or(""); }
+    void DescribeRequest(int nRequest, ServicePlan& plan) const;
+    void DescribeStored(int nRule, ServicePlan& plan) const;
+    void Append(ServicePlan& plan) const;
 
-    std::string mSzService;
-    OpenRules mStored;
-    OpenRules mRequested;
+    const QuietHost mHost;
+    const std::string mSzService;
+    const Requests& mRgRequests;
+    const Records& mRgStored;
+    lib::OperationRules mStored;
+    lib::OperationRules mRequested;
+    std::vector<PortList> mRgStoredPorts;  // of the router, as they were
+    std::vector<PortList> mRgRequestedPorts;
+    const char* mSzUndecided = kNoLongerAsked;  // why a pair goes that no rule decides over
+    std::map<const OPERATION_RULE*, std::vector<Gone>> mMapGone;
+    const OPERATION_RULE* mPLastRule = nullptr;  // that of the last pair that went, and who decided over it
+    const OPERATION_RULE* mPLastDecider = nullptr;
     std::string mSzRefusal;
 };
 
@@ -164,215 +90,195 @@ bool Merge::Refuse(const std::string& szWhy) {
     return false;
 }
 
-bool Merge::TakeStored(const std::vector<__tag_TAVO_ROUTER_RULE>& rgStored) {
-    for (const __tag_TAVO_ROUTER_RULE& record : rgStored) {
-        OpenRule open{.rule = {record.szRuleID, record.blEnable, record.szProtocol, record.szRouterPort,
-                               record.szSrcPort, record.szServiceID, record.szServiceName}};
-        const auto pWord = std::find(kProtocolWords.begin(), kProtocolWords.end(), record.szProtocol);
-        const auto rgRouter = TakeApart(record.szRouterPort);
-        const auto rgBox = TakeApart(record.szSrcPort);
-        if (pWord == kProtocolWords.end() || !rgRouter || !rgBox) {
-            return Refuse(fmt::format("the protocol or the ports of rule {} cannot be read", NameOf(open.rule)));
-        }
-        open.enProtocol = static_cast<int>(pWord - kProtocolWords.begin());
-        open.rgRouter = *rgRouter;
-        open.rgBox = *rgBox;
-        open.rgszGone.resize(open.rgRouter.size());
-        mStored.push_back(std::move(open));
-    }
-    return true;
-}
-
-bool Merge::TakeRequests(const Requests& rgRequests) {
-    for (const __tag_TAVO_PORTMAP_RULE& request : rgRequests) {
-        const auto rgPorts = TakeApart(request.szPorts);
-        if (!rgPorts) {
-            return Refuse(fmt::format("the ports '{}' cannot be read", Clean(request.szPorts)));
-        }
-        mRequested.push_back({.rule = {"", true, kProtocolWords[static_cast<size_t>(request.enProtocol)], "", "",
-                                       mSzService == kHopLink ? "HopLink" : "", mSzService},
-                              .enProtocol = request.enProtocol,
-                              .rgRouter = *rgPorts,
-                              .rgBox = *rgPorts,
-                              .rgszGone = std::vector<std::string>(rgPorts->size())});
-    }
-    return true;
-}
-
-void Merge::DropOwn() {
-    for (OpenRule& rule : mStored) {
-        rule.blDeleted = rule.rule.blEnabled && IsOwn(rule);
-    }
-}
-
-bool Merge::RunRule(const Pass& pass, OpenRule& rule, const Places& places) {
-    for (size_t i = rule.rgRouter.size(); i-- > 0;) {
-        if (!rule.IsIn(i)) {
-            continue;
-        }
-        const auto found = places.Find(rule.rgRouter[i], rule.rgBox[i]);
-        if (found && !found->second) {
-            const Rule& asked = rule.rule;
-            const Rule& other = pass.others[found->first].rule;
-            const std::string szPort = fmt::format("{}/{}", rule.rgRouter[i], asked.szProtocol);
-            return Refuse(
-                asked.szId.empty()
-                    ? fmt::format("port {} is only half of what rule {} forwards ({} to {})", szPort, NameOf(other),
-                                  Clean(other.szRouterPorts), Clean(other.szBoxPorts))
-                    : fmt::format("rule {}, which is switched off, forwards {} to another port of the box, and the "
-                                  "request names one of the two",
-                                  NameOf(asked), szPort));
-        }
-        if (found.has_value() == pass.blGoesWhenFound) {
-            rule.rgszGone[i] = pass.fnWhy(found ? pass.others[found->first] : rule);
+const __tag_TAVO_ROUTER_RULE* Merge::RecordOf(const OPERATION_RULE& rule) const {
+    for (size_t i = 0; i < mRgStored.size(); ++i) {
+        if (mStored.rgRules + i == &rule) {
+            return &mRgStored[i];
         }
     }
-    rule.blDeleted = rule.IsEmpty();
-    return true;
+    return nullptr;
 }
 
-bool Merge::Run(const Pass& pass) {
-    std::map<int, Places> mapPlaces;
-    for (OpenRule& rule : pass.rules) {
-        if (rule.blDeleted || !pass.fnSelect(rule)) {
-            continue;
-        }
-        if (!rule.IsPaired()) {
-            return Refuse(fmt::format("rule {} has {} router ports but {} box ports", NameOf(rule.rule),
-                                      rule.rgRouter.size(), rule.rgBox.size()));
-        }
-        auto it = mapPlaces.find(rule.enProtocol);
-        if (it == mapPlaces.end()) {
-            it = mapPlaces.emplace(rule.enProtocol, Places(pass.others, rule.enProtocol, pass.fnSelectOthers)).first;
-        }
-        if (!RunRule(pass, rule, it->second)) {
-            return false;
-        }
-    }
-    return true;
-}
+// ---- the merge ------------------------------------------------------------------------------------------
 
-bool Merge::RunPasses() {
-    const Filter fnEvery = [](const OpenRule&) { return true; };
-    const Filter fnOthersOn = [this](const OpenRule& rule) { return !IsOwn(rule) && rule.rule.blEnabled; };
-    const Filter fnOwnOff = [this](const OpenRule& rule) { return IsOwn(rule) && !rule.rule.blEnabled; };
-    return Run({mStored, fnOwnOff, mRequested, fnEvery, false,
-                [](const OpenRule&) { return "the service no longer asks for it"; }}) &&
-           Run({mRequested, fnEvery, mStored, fnOthersOn, true,
-                [](const OpenRule& rule) { return fmt::format("rule {} has it already", NameOf(rule.rule)); }}) &&
-           Run({mRequested, fnEvery, mStored, fnOwnOff, true, [](const OpenRule& rule) {
-                    return fmt::format("rule {} switches it off for the service", NameOf(rule.rule));
-                }});
-}
-
-bool Merge::YieldRules(OpenRules& rules, const UsedPorts& used) {
-    for (OpenRule& rule : rules) {
-        if (!IsOwn(rule)) {
-            continue;
-        }
-        if (!rule.IsPaired()) {
-            return Refuse(fmt::format("rule {} has {} router ports but {} box ports", NameOf(rule.rule),
-                                      rule.rgRouter.size(), rule.rgBox.size()));
-        }
-        // Of both protocols, the library looks at TCP alone.
-        const std::set<int>& setUsed =
-            kProtocolWords[static_cast<size_t>(rule.enProtocol)] == "udp" ? used.setUdp : used.setTcp;
-        for (size_t i = 0; i < rule.rgRouter.size(); ++i) {
-            if (rule.IsIn(i) && setUsed.count(rule.rgRouter[i]) != 0) {
-                rule.rgszGone[i] = "another host holds it on the router";
+// What cannot be read is looked for one by one.
+bool Merge::Build() {
+    if (CreateOperationRulesArray(mHost, &mStored.rgRules, &mStored.nRules, mRgStored.data(),
+                                  static_cast<int>(mRgStored.size())) != 0) {
+        for (const __tag_TAVO_ROUTER_RULE& record : mRgStored) {
+            lib::OperationRules one;
+            if (CreateOperationRulesArray(mHost, &one.rgRules, &one.nRules, &record, 1) != 0) {
+                return Refuse(fmt::format("the protocol or the ports of rule {} cannot be read", NameOf(record)));
             }
         }
-        rule.blDeleted = rule.blDeleted || rule.IsEmpty();
+        throw std::bad_alloc();
+    }
+    if (CreateOperationRulesArray(mHost, &mRequested.rgRules, &mRequested.nRules, mSzService.c_str(),
+                                  mRgRequests.data(), static_cast<int>(mRgRequests.size())) != 0) {
+        for (const __tag_TAVO_PORTMAP_RULE& request : mRgRequests) {
+            PortList ports;
+            if (ParsePorts(mHost, ports, request.szPorts) != 0) {
+                return Refuse(fmt::format("the ports '{}' cannot be read", Clean(request.szPorts)));
+            }
+        }
+        throw std::bad_alloc();
+    }
+    for (int i = 0; i < mStored.nRules; ++i) {
+        mRgStoredPorts.push_back(*mStored.rgRules[i].routerPortSet);
+    }
+    for (int i = 0; i < mRequested.nRules; ++i) {
+        mRgRequestedPorts.push_back(*mRequested.rgRules[i].routerPortSet);
     }
     return true;
 }
 
-bool Merge::YieldToOthers(const UsedPorts& used) {
-    return YieldRules(mRequested, used) && YieldRules(mStored, used);
+bool Merge::RunPasses(const std::optional<UsedPorts>& used) {
+    if (DeletePortsFromRuleConf(mHost, mStored.rgRules, mStored.nRules, mSzService.c_str()) != 0 ||
+        DeletePortsFromInputRules(mHost, mRequested.rgRules, mRequested.nRules, mStored.rgRules, mStored.nRules,
+                                  mSzService.c_str(), this) != 0) {
+        return false;
+    }
+    mSzUndecided = kHeldByOther;
+    mPLastRule = nullptr;
+    return !used || DeleteUsedPorts(mHost, mRequested.rgRules, mRequested.nRules, mStored.rgRules, mStored.nRules,
+                                    mSzService.c_str(), *used, this) == 0;
+}
+
+std::string Merge::WhyGone(const OPERATION_RULE* pDecider) const {
+    const __tag_TAVO_ROUTER_RULE* pRecord = pDecider == nullptr ? nullptr : RecordOf(*pDecider);
+    if (pRecord == nullptr) {
+        return mSzUndecided;
+    }
+    return "rule " + NameOf(*pRecord) + (pDecider->blEnable ? " has it already" : " switches it off for the service");
+}
+
+void Merge::OnRemoved(const OPERATION_RULE& rule, int nRouterPort, int /*nBoxPort*/, const OPERATION_RULE* pDecider) {
+    std::vector<Gone>& rgGone = mMapGone[&rule];
+    if (&rule != mPLastRule || pDecider != mPLastDecider) {
+        rgGone.push_back({{}, WhyGone(pDecider)});
+        mPLastRule = &rule;
+        mPLastDecider = pDecider;
+    }
+    rgGone.back().ports.push_back(nRouterPort);
+}
+
+void Merge::OnTorn(const OPERATION_RULE& rule, int nRouterPort, int /*nBoxPort*/, const OPERATION_RULE& decider) {
+    const std::string szPort = fmt::format("{}/{}", nRouterPort, ToProtocolString(mHost, rule.protocol));
+    if (const __tag_TAVO_ROUTER_RULE* pAsked = RecordOf(rule)) {
+        Refuse(
+            fmt::format("rule {}, which is switched off, forwards {} to another port of the box, and the request "
+                        "names one of the two",
+                        NameOf(*pAsked), szPort));
+    } else if (const __tag_TAVO_ROUTER_RULE* pOther = RecordOf(decider)) {
+        Refuse(fmt::format("port {} is only half of what rule {} forwards ({} to {})", szPort, NameOf(*pOther),
+                           Clean(pOther->szRouterPort), Clean(pOther->szSrcPort)));
+    }
+}
+
+void Merge::OnUneven(const OPERATION_RULE& rule) {
+    if (const __tag_TAVO_ROUTER_RULE* pRecord = RecordOf(rule)) {
+        Refuse(fmt::format("rule {} has {} router ports but {} box ports", NameOf(*pRecord), rule.routerPortSet->size(),
+                           rule.boxPortSet->size()));
+    }
 }
 
 // ---- the outcome ----------------------------------------------------------------------------------------
 
-void Merge::DescribeRequest(const OpenRule& rule, ServicePlan& plan) const {
-    for (size_t i = 0; i < rule.rgRouter.size();) {
-        Ports rgSame;
-        const std::string& szWhy = rule.rgszGone[i];
-        for (; i < rule.rgRouter.size() && rule.rgszGone[i] == szWhy; ++i) {
-            rgSame.push_back(rule.rgRouter[i]);
+// The ports as they were, in their order, neighbours of one fate together. A pair that stands twice has one fate.
+std::vector<Gone> Merge::FatesOf(const OPERATION_RULE& rule, const PortList& before) const {
+    static const std::string kStays;
+    std::vector<const std::string*> rgpWhy(kPorts, &kStays);
+    if (const auto it = mMapGone.find(&rule); it != mMapGone.end()) {
+        for (const Gone& gone : it->second) {
+            for (const int nPort : gone.ports) {
+                rgpWhy[static_cast<size_t>(nPort)] = &gone.szWhy;
+            }
         }
-        plan.rgPorts.push_back({ToText(rgSame), rule.rule.szProtocol, szWhy});
+    }
+    std::vector<Gone> rgFates;
+    for (const int nPort : before) {
+        const std::string& szWhy = *rgpWhy[static_cast<size_t>(nPort)];
+        if (rgFates.empty() || rgFates.back().szWhy != szWhy) {
+            rgFates.push_back({{}, szWhy});
+        }
+        rgFates.back().ports.push_back(nPort);
+    }
+    return rgFates;
+}
+
+void Merge::DescribeRequest(int nRequest, ServicePlan& plan) const {
+    const OPERATION_RULE& rule = mRequested.rgRules[nRequest];
+    for (const Gone& fate : FatesOf(rule, mRgRequestedPorts[static_cast<size_t>(nRequest)])) {
+        plan.rgPorts.push_back({ToText(fate.ports), ToProtocolString(mHost, rule.protocol), fate.szWhy});
     }
 }
 
-void Merge::DescribeStored(const OpenRule& rule, ServicePlan& plan) const {
+void Merge::DescribeStored(int nRule, ServicePlan& plan) const {
+    const OPERATION_RULE& rule = mStored.rgRules[nRule];
+    const std::string szName = NameOf(mRgStored[static_cast<size_t>(nRule)]);
     if (rule.blDeleted) {
-        plan.rgRules.push_back({NameOf(rule.rule), rule.rule.blEnabled ? "goes; the request takes its place"
-                                                                       : "goes; none of its ports is left"});
+        plan.rgRules.push_back(
+            {szName, rule.blEnable ? "goes; the request takes its place" : "goes; none of its ports is left"});
         return;
     }
-    std::map<std::string, Ports> mapGone;
-    for (size_t i = 0; i < rule.rgszGone.size(); ++i) {
-        if (!rule.IsIn(i)) {
-            mapGone[rule.rgszGone[i]].push_back(rule.rgRouter[i]);
+    if (mMapGone.count(&rule) == 0) {
+        return;
+    }
+    std::map<std::string, PortList> mapGone;
+    for (const Gone& fate : FatesOf(rule, mRgStoredPorts[static_cast<size_t>(nRule)])) {
+        for (const int nPort : fate.ports) {
+            mapGone[fate.szWhy].push_back(nPort);
         }
     }
-    for (const auto& [szWhy, rgPorts] : mapGone) {
-        plan.rgRules.push_back({NameOf(rule.rule), fmt::format("loses {}: {}", ToText(rgPorts), szWhy)});
+    mapGone.erase("");
+    for (const auto& [szWhy, ports] : mapGone) {
+        plan.rgRules.push_back({szName, fmt::format("loses {}: {}", ToText(ports), szWhy)});
     }
 }
 
-void Merge::Append(const OpenRules& rules, ServicePlan& plan) {
-    for (const OpenRule& open : rules) {
-        if (open.blDeleted) {
-            continue;
+void Merge::Append(ServicePlan& plan) const {
+    lib::RouterRules after;
+    if (CreateRulesArray(mHost, &after.rgRules, &after.nRules, mStored.rgRules, mStored.nRules, mRequested.rgRules,
+                         mRequested.nRules) != 0) {
+        throw std::bad_alloc();
+    }
+    for (int i = 0; i < after.nRules; ++i) {
+        const __tag_TAVO_ROUTER_RULE& record = after.rgRules[i];
+        plan.after.push_back({record.szRuleID, record.blEnable, record.szProtocol, record.szRouterPort,
+                              record.szSrcPort, record.szServiceID, record.szServiceName});
+    }
+    for (const lib::OperationRules* pRules : {&mStored, &mRequested}) {
+        for (int i = 0; i < pRules->nRules; ++i) {
+            const OPERATION_RULE& rule = pRules->rgRules[i];
+            plan.blCut = plan.blCut || (!rule.blDeleted && !FitsRecord(mHost, rule));
         }
-        Rule rule = open.rule;
-        Ports rgRouter, rgBox;
-        for (size_t i = 0; i < std::max(open.rgRouter.size(), open.rgBox.size()); ++i) {
-            if (open.IsIn(i) && i < open.rgRouter.size()) {
-                rgRouter.push_back(open.rgRouter[i]);
-            }
-            if (open.IsIn(i) && i < open.rgBox.size()) {
-                rgBox.push_back(open.rgBox[i]);
-            }
-        }
-        rule.szId = std::to_string(plan.after.size() + 1);
-        rule.szRouterPorts = ToText(rgRouter);
-        rule.szBoxPorts = ToText(rgBox);
-        plan.blCut = Cut(rule.szRouterPorts) || plan.blCut;
-        plan.blCut = Cut(rule.szBoxPorts) || plan.blCut;
-        plan.after.push_back(rule);
     }
 }
 
 ServicePlan Merge::Conclude() const {
-    ServicePlan plan{.szRefusal = mSzRefusal};
-    if (!mSzRefusal.empty()) {
-        return plan;
+    ServicePlan plan;
+    for (int i = 0; i < mRequested.nRules; ++i) {
+        DescribeRequest(i, plan);
     }
-    for (const OpenRule& rule : mRequested) {
-        DescribeRequest(rule, plan);
+    for (int i = 0; i < mStored.nRules; ++i) {
+        DescribeStored(i, plan);
     }
-    for (const OpenRule& rule : mStored) {
-        DescribeStored(rule, plan);
-    }
-    Append(mStored, plan);
-    Append(mRequested, plan);
+    Append(plan);
     return plan;
+}
+
+ServicePlan Merge::Run(const std::optional<UsedPorts>& used) {
+    if (Build() && RunPasses(used)) {
+        return Conclude();
+    }
+    return {.szRefusal = mSzRefusal.empty() ? "the rules cannot be merged" : mSzRefusal};
 }
 
 }  // namespace
 
 ServicePlan MakePlan(const std::string& szService, const Requests& rgRequests,
                      const std::vector<__tag_TAVO_ROUTER_RULE>& rgStored, const std::optional<UsedPorts>& used) {
-    Merge merge(szService);
-    if (merge.TakeStored(rgStored) && merge.TakeRequests(rgRequests)) {
-        merge.DropOwn();
-        if (merge.RunPasses() && used) {
-            merge.YieldToOthers(*used);
-        }
-    }
-    return merge.Conclude();
+    return Merge(szService, rgRequests, rgStored).Run(used);
 }
 
 }  // namespace tavo::cli

@@ -1,24 +1,20 @@
 // What a service's request would come to: which of its ports open, which do not and why, and what becomes of
-// the stored rules. Relies on nothing but what is handed in. Promises: the outcome is that of the library's own
-// merge, rule by rule and port by port; nothing is changed.
+// the stored rules. Relies on the library's own merge, over what is handed in. Promises: the outcome is the merge's,
+// rule by rule and port by port; nothing is changed.
 #pragma once
 
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
 #include "RuleStore.h"
+#include "src/merge/UsedPorts.h"
 
 namespace tavo::cli {
 
 using Requests = std::vector<__tag_TAVO_PORTMAP_RULE>;
 
-// What other hosts hold on the router.
-struct UsedPorts {
-    std::set<int> setTcp;
-    std::set<int> setUdp;
-};
+using lib::UsedPorts;  // what other hosts hold on the router
 
 struct PortFate {
     std::string szPorts;
