@@ -115,12 +115,13 @@ std::string FaultOf(const Rule& rule) {
     if (rule.szName.find('\0') != std::string::npos || rule.szServiceId.find('\0') != std::string::npos) {
         return "a name cannot hold a NUL character";
     }
-    const size_t nLongest =
-        std::max({rule.szRouterPorts.size(), rule.szBoxPorts.size(), rule.szName.size(), rule.szServiceId.size()});
-    return nLongest < TAVO_TEXT_SIZE
-               ? ""
-               : fmt::format("a name or port list is {} bytes long; {} is the most that a rule can hold", nLongest,
-                             TAVO_TEXT_SIZE - 1);
+    const size_t nPorts = std::max(rule.szRouterPorts.size(), rule.szBoxPorts.size());
+    const size_t nNames = std::max(rule.szName.size(), rule.szServiceId.size());
+    return nPorts > kMostPortText
+               ? fmt::format("a port list is {} bytes long; {} is the most that a rule can hold", nPorts, kMostPortText)
+           : nNames >= TAVO_TEXT_SIZE
+               ? fmt::format("a name is {} bytes long; {} is the most that a rule can hold", nNames, TAVO_TEXT_SIZE - 1)
+               : "";
 }
 
 std::optional<Rules> ReadImport(const std::string& szText, std::string& szFault) {

@@ -86,9 +86,9 @@ std::optional<Rules> LoadRules() {
         }
         rules.push_back(rule);
     }
-    // An absent file and an unreadable one look the same to the reader, but not to this count.
-    const auto rgRecords = LoadRecords();
-    return rgRecords && rgRecords->size() == rules.size() ? std::optional(rules) : std::nullopt;
+    // An absent file and an unreadable one look the same to the reader, but not to the library, which refuses a rule
+    // that is too long for its records.
+    return !rules.empty() || LoadRecords() ? std::optional(rules) : std::nullopt;
 }
 
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords() {
@@ -102,7 +102,26 @@ std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> LoadRecords() {
     return rgRecords;
 }
 
+std::string TooLong(const Rules& rules) {
+    for (const Rule& rule : rules) {
+        const bool blPorts = std::max(rule.szRouterPorts.size(), rule.szBoxPorts.size()) > kMostPortText;
+        const size_t nText =
+            std::max({rule.szId.size(), rule.szProtocol.size(), rule.szServiceId.size(), rule.szName.size()});
+        if (blPorts || nText >= TAVO_TEXT_SIZE) {
+            return fmt::format(
+                "{} of rule {} is longer than {} bytes and would be cut: 'tavoportmap rules list' shows it, {}. "
+                "Nothing was changed",
+                blPorts ? "a port list" : "a name", Clean(rule.szId), blPorts ? kMostPortText : TAVO_TEXT_SIZE - 1,
+                blPorts ? "'rules edit' makes it shorter and 'rules add' takes the rest" : "'rules edit' changes it");
+        }
+    }
+    return "";
+}
+
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules) {
+    if (!TooLong(rules).empty()) {
+        return std::nullopt;
+    }
     std::vector<__tag_TAVO_ROUTER_RULE> rgRecords(rules.size());
     for (size_t i = 0; i < rules.size(); ++i) {
         const Rule& rule = rules[i];

@@ -62,7 +62,11 @@ inline bool IsOff() {
 bool StoreOff(const Rules& rules);
 bool DropOff();
 
-// As the library takes them; nothing when a value is too long for its record.
+// Most bytes of a list of ports: one that fills its record is taken for one that was cut.
+inline constexpr size_t kMostPortText = TAVO_TEXT_SIZE - 2;
+// Which rule is too long for a record, and what to do; empty when all of them fit.
+std::string TooLong(const Rules& rules);
+// As the library takes them; nothing when one is too long.
 std::optional<std::vector<__tag_TAVO_ROUTER_RULE>> ToRecords(const Rules& rules);
 
 extern const char kUnreadable[];

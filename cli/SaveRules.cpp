@@ -201,10 +201,8 @@ std::optional<Reply> Unwritable(const Rules& rules) {
                          "a rule file holds 16 MiB, and the names and port lists of these rules are more. "
                          "Nothing was changed"};
     }
-    if (!ToRecords(rules)) {
-        return Failure(
-            "a name or a port list of a rule is longer than 1023 bytes and would be cut: 'tavoportmap rules list' "
-            "shows it, 'rules edit' changes it. Nothing was changed");
+    if (const std::string szWhy = TooLong(rules); !szWhy.empty()) {
+        return Failure(szWhy);
     }
     return std::nullopt;
 }

@@ -108,15 +108,15 @@ Reply LookAround(const Wish& wish, Surroundings& found) {
         return *settings.obstacle;
     }
     const auto rules = LoadRules();
-    const auto rgStored = LoadRecords();
-    if (!rules || !rgStored) {
+    if (!rules) {
         return NeedsRoot().value_or(Unreadable());
     }
-    if (!ToRecords(*rules)) {
-        return Failure(
-            "a name or a port list of a rule is longer than 1023 bytes and would be cut: 'tavoportmap rules list' "
-            "shows "
-            "it, 'rules edit' changes it. Nothing was changed");
+    if (const std::string szWhy = TooLong(*rules); !szWhy.empty()) {
+        return Failure(szWhy);
+    }
+    const auto rgStored = LoadRecords();
+    if (!rgStored) {
+        return NeedsRoot().value_or(Unreadable());
     }
     found.rgStored = *rgStored;
     found.router = ReadServiceRouter(settings);
@@ -136,9 +136,6 @@ Reply LookAround(const Wish& wish, Surroundings& found) {
     CheckCapacity(found);
     return {};
 }
-
-constexpr char kCut[] =
-    "a rule's list of ports would get longer than a rule can hold, and lose its end: ask for fewer pieces";
 
 // What a user must agree to with --force; empty when there is nothing.
 std::string Objection(const Wish& wish, const Surroundings& found) {
@@ -204,7 +201,8 @@ Reply Plan(const Wish& wish) {
         reply.szMessage =
             fmt::format("there would be {} rules, numbered from 1; nothing was changed", found.plan.after.size());
     }
-    if (const std::string szFault = found.plan.blCut ? kCut : Objection(wish, found); !szFault.empty()) {
+    if (const std::string szFault = !found.plan.szCut.empty() ? found.plan.szCut : Objection(wish, found);
+        !szFault.empty()) {
         reply.rgszWarnings.push_back(szFault);
     }
     return reply;
@@ -322,8 +320,8 @@ std::optional<Reply> Objections(const Wish& wish, const Surroundings& found) {
         return Reply{.enExit = kFailed,
                      .szMessage = "every port is switched off, and nothing was changed; 'tavoportmap on' comes first"};
     }
-    if (found.plan.blCut) {
-        return Reply{.enExit = kUsage, .szMessage = kCut};
+    if (!found.plan.szCut.empty()) {
+        return Reply{.enExit = kUsage, .szMessage = found.plan.szCut};
     }
     if (const std::string szFault = Objection(wish, found); !szFault.empty() && !wish.blForce) {
         return Reply{.enExit = kUsage, .szMessage = szFault};

@@ -4,6 +4,7 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <map>
 #include <new>
 
@@ -68,6 +69,7 @@ private:
     std::string ToText(const PortList& ports) const { return lib::ToText(mHost, ports).value_or(""); }
     void DescribeRequest(int nRequest, ServicePlan& plan) const;
     void DescribeStored(int nRule, ServicePlan& plan) const;
+    std::string WhyCut() const;
     void Append(ServicePlan& plan) const;
 
     const QuietHost mHost;
@@ -236,6 +238,23 @@ void Merge::DescribeStored(int nRule, ServicePlan& plan) const {
     }
 }
 
+// A merge writes every list anew, with a blank behind each comma, and cuts what its rule does not hold.
+std::string Merge::WhyCut() const {
+    const auto fnIsCut = [this](const OPERATION_RULE& rule) { return !rule.blDeleted && !FitsRecord(mHost, rule); };
+    const OPERATION_RULE* pEnd = mStored.rgRules + mStored.nRules;
+    if (const OPERATION_RULE* pCut = std::find_if(mStored.rgRules, mStored.rgRules + mStored.nRules, fnIsCut);
+        pCut != pEnd) {
+        return fmt::format(
+            "the list of ports of rule {} would get longer than a rule can hold, and lose its end, as it does when the "
+            "service asks by itself: make it two rules with 'rules edit' and 'rules add'",
+            NameOf(*RecordOf(*pCut)));
+    }
+    return std::any_of(mRequested.rgRules, mRequested.rgRules + mRequested.nRules, fnIsCut)
+               ? "a list of ports of the request would get longer than a rule can hold, and lose its end: ask for "
+                 "fewer pieces"
+               : "";
+}
+
 void Merge::Append(ServicePlan& plan) const {
     lib::RouterRules after;
     if (CreateRulesArray(mHost, &after.rgRules, &after.nRules, mStored.rgRules, mStored.nRules, mRequested.rgRules,
@@ -247,12 +266,7 @@ void Merge::Append(ServicePlan& plan) const {
         plan.after.push_back({record.szRuleID, record.blEnable, record.szProtocol, record.szRouterPort,
                               record.szSrcPort, record.szServiceID, record.szServiceName});
     }
-    for (const lib::OperationRules* pRules : {&mStored, &mRequested}) {
-        for (int i = 0; i < pRules->nRules; ++i) {
-            const OPERATION_RULE& rule = pRules->rgRules[i];
-            plan.blCut = plan.blCut || (!rule.blDeleted && !FitsRecord(mHost, rule));
-        }
-    }
+    plan.szCut = WhyCut();
 }
 
 ServicePlan Merge::Conclude() const {

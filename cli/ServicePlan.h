@@ -31,8 +31,9 @@ struct ServicePlan {
     std::string szRefusal = {};  // why the request would fail as a whole; the rest is empty then
     std::vector<PortFate> rgPorts = {};
     std::vector<RuleFate> rgRules = {};
-    Rules after = {};    // rule.conf, as it would be
-    bool blCut = false;  // a list of ports there is longer than a rule holds, and loses its end
+    Rules after = {};  // rule.conf, as it would be
+    std::string szCut =
+        {};  // whose list of ports would be longer there than a rule holds, and lose its end; empty: none
 };
 
 // rgStored: as the library's own reader gives them. used: nothing where the router is not asked.

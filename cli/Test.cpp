@@ -60,7 +60,7 @@ Rules Chosen(const Rules& rules, const std::vector<std::string>& rgszIds, std::s
 Reply TestParts(const Rules& parts, bool blJson) {
     auto rgRecords = ToRecords(parts);
     if (!rgRecords) {
-        return Failure("a value in /etc/portforward/rule.conf is longer than the library takes");
+        return Failure(TooLong(parts));
     }
     Progress progress(blJson);
     progress.Show(0, "having the ports looked at from outside; half a minute at most");

@@ -33,6 +33,11 @@ std::vector<uint16_t> Flatten(const std::vector<PortRange>& rgRanges) {
     return rgPorts;
 }
 
+// Without the item that a cut may have gone through.
+std::string_view SurePart(std::string_view szPorts) {
+    return MayBeCut(szPorts) ? szPorts.substr(0, std::min(szPorts.rfind(','), szPorts.size())) : szPorts;
+}
+
 bool IsWord(std::string_view szText, const char* szWord) {
     return strcasecmp(std::string(szText).c_str(), szWord) == 0;
 }
@@ -75,16 +80,25 @@ std::optional<ProtocolSet> ParseProtocol(std::string_view szText) {
     return std::nullopt;
 }
 
+bool MayBeCut(std::string_view szPorts) {
+    return szPorts.size() == TAVO_PF_PORTS_SIZE - 1;
+}
+
 std::optional<std::vector<SingleMapping>> ExpandRule(std::string_view szProtocol, std::string_view szRouterPorts,
                                                      std::string_view szBoxPorts) {
     const auto protocols = ParseProtocol(szProtocol);
-    const auto rgRouterRanges = ParsePortRanges(szRouterPorts);
-    const auto rgBoxRanges = ParsePortRanges(szBoxPorts);
+    const auto rgRouterRanges = ParsePortRanges(SurePart(szRouterPorts));
+    const auto rgBoxRanges = ParsePortRanges(SurePart(szBoxPorts));
     if (!protocols || !rgRouterRanges || !rgBoxRanges) {
         return std::nullopt;
     }
-    const std::vector<uint16_t> rgRouterPorts = Flatten(*rgRouterRanges);
-    const std::vector<uint16_t> rgBoxPorts = Flatten(*rgBoxRanges);
+    std::vector<uint16_t> rgRouterPorts = Flatten(*rgRouterRanges);
+    std::vector<uint16_t> rgBoxPorts = Flatten(*rgBoxRanges);
+    if (MayBeCut(szRouterPorts) || MayBeCut(szBoxPorts)) {
+        const size_t nPairs = std::min(rgRouterPorts.size(), rgBoxPorts.size());
+        rgRouterPorts.resize(nPairs);
+        rgBoxPorts.resize(nPairs);
+    }
     if (rgRouterPorts.size() != rgBoxPorts.size()) {
         return std::nullopt;
     }

@@ -36,8 +36,12 @@ struct ProtocolSet {
 };
 std::optional<ProtocolSet> ParseProtocol(std::string_view szText);
 
+// Whether a list of ports fills a record to its end. The library cuts what does not fit, in the middle of a number
+// perhaps: then the last item names ports that nobody wrote.
+bool MayBeCut(std::string_view szPorts);
+
 // The n-th router port with the n-th box port, for each protocol. Nothing when a text cannot be read or
-// the two sides have different numbers of ports.
+// the two sides have different numbers of ports. Of a list that may be cut, what stands before its last item.
 std::optional<std::vector<SingleMapping>> ExpandRule(std::string_view szProtocol, std::string_view szRouterPorts,
                                                      std::string_view szBoxPorts);
 

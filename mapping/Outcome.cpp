@@ -20,6 +20,9 @@ constexpr std::pair<std::string_view, const char*> kWhy[] = {
     {"729", "the router uses this port itself, or forwards it by a setting of its own"},
     {"lost", "the router said yes and does not keep it; its table may be full"},
     {"invalid", "the rule's router and box ports cannot be paired"},
+    {"cut",
+     "the list of ports is so long that it may have lost its end, and the last of them are not asked for; write it as "
+     "two rules"},
     {"duplicate", "an earlier rule sends this port to another port of the box"},
     {"noigd", "the gateway offers no UPnP port mapping"},
     {"nogateway", "there is no gateway"},

@@ -120,12 +120,14 @@ WantedSet ReadWanted(const char* szRunKey) {
         if (Value(pRule, "enabled") != "1") {
             continue;
         }
-        const auto rgSingles =
-            ExpandRule(Value(pRule, "protocol name"), Value(pRule, "r_port"), Value(pRule, "s_port"));
+        const std::string szRouterPorts = Value(pRule, "r_port");
+        const std::string szBoxPorts = Value(pRule, "s_port");
+        const auto rgSingles = ExpandRule(Value(pRule, "protocol name"), szRouterPorts, szBoxPorts);
         if (rgSingles) {
             AddRule(pRule, *rgSingles, mapBoxPorts, wanted);
-        } else {
-            wanted.rgRefused.push_back(RefusedRule(RuleName(pRule), "invalid", pRule));
+        }
+        if (!rgSingles || MayBeCut(szRouterPorts) || MayBeCut(szBoxPorts)) {
+            wanted.rgRefused.push_back(RefusedRule(RuleName(pRule), rgSingles ? "cut" : "invalid", pRule));
         }
     }
     NameApart(wanted);

@@ -15,8 +15,8 @@ namespace tavo {
 
 struct WantedSet {
     std::vector<RouterMapping> rgMappings;  // client and lease still to be filled
-    // What no router is asked for, each under a name of its own: rules whose ports cannot be paired ("invalid"), and
-    // ports that an earlier rule sends to another port of the box ("duplicate").
+    // What no router is asked for, each under a name of its own: rules whose ports cannot be paired ("invalid"), what
+    // may have lost its end ("cut"), and ports that an earlier rule sends to another port of the box ("duplicate").
     OutcomeList rgRefused;
     std::map<std::string, std::string> mapRules;  // which rule asked for a mapping, by the mapping's name
     bool blReadable = true;

@@ -64,6 +64,10 @@ void Splitter::RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy) {
 }
 
 void Splitter::Add(const TAVO_PF_CONF* pRule) {
+    if (MayBeCut(Value(pRule, "r_port")) || MayBeCut(Value(pRule, "s_port"))) {
+        RefuseRule(pRule, "its list of ports is so long that it may have lost its end; write it as two rules");
+        return;
+    }
     const auto protocols = ParseProtocol(Value(pRule, "protocol name"));
     const auto rgRanges = ParsePortRanges(Value(pRule, "r_port"));
     // One protocol is enough to pair the ports.

@@ -283,7 +283,7 @@ std::optional<std::string> ToText(const MergeHost& host, const PortList& ports) 
 bool FitsRecord(const MergeHost& host, const OPERATION_RULE& rule) {
     const auto fnFits = [&host](const PortList& ports) {
         const auto szText = ToText(host, ports);
-        return szText && szText->size() < TAVO_TEXT_SIZE;
+        return szText && szText->size() < TAVO_TEXT_SIZE - 1;
     };
     return fnFits(*rule.routerPortSet) && fnFits(*rule.boxPortSet);
 }

@@ -96,7 +96,7 @@ int ParsePorts(const MergeHost& host, PortList& ports, const char* szPort);
 int ToPorts(const MergeHost& host, char* szOutPorts, int nOutPorts, const PortList& ports);
 // The whole text; nothing for a list with an invalid port.
 std::optional<std::string> ToText(const MergeHost& host, const PortList& ports);
-// Whether a record holds the whole text of both lists.
+// Whether a record holds the whole text of both lists with room to spare: one that fills it is taken for a cut one.
 bool FitsRecord(const MergeHost& host, const OPERATION_RULE& rule);
 
 // A PORTMAP_PROTOCOL, or -1 for a text other than "tcp", "udp", "all".

@@ -186,6 +186,31 @@ class Tool(unittest.TestCase):
         self.assertEqual([rule["name"] for rule in before], [long_name, ""])
         self.expect("save", FAILED, "longer than 1023 bytes and would be cut", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
 
+    def test_no_port_comes_of_a_list_that_is_cut(self):
+        """What is a byte too long for the library's records, or would be after a merge, is refused beforehand."""
+        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="0"\n')
+        world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:9", "TAVO_SAVE": "0 write"}
+        listed = lambda *ends: ",".join(map(str, [*range(1001, 1408, 2), *ends]))
+        self.assertEqual([len(listed()), len(listed(443))], [1019, 1023])
+        for ports, plan, code in ((listed(44), "rule 7 .web. would get longer.*when the service asks by itself", USAGE),
+                                  (listed(443), "a port list of rule 7 is longer than 1022 bytes and would be cut", FAILED),
+                                  (listed(4433), "a port list of rule 7 is longer than 1022 bytes and would be cut", FAILED)):
+            self.store((1, "tcp", ports, ports, "web"))
+            before = get(RULES)
+            self.expect("service plan hoplink 80/tcp", OK if code == USAGE else FAILED, plan, **world)
+            self.expect("service set hoplink 80/tcp --force", code, plan, **world)
+            self.assertEqual(self.rows()[0][3], ports, "the tool still shows it whole")
+            self.expect("rules add --router-port 90", OK, "noted")
+            self.expect("save", OK if code == USAGE else FAILED, "in force" if code == USAGE else "1022 bytes", **WRITES)
+            if code == FAILED:
+                self.assertEqual(get(RULES), before)
+                self.expect("rules remove 7", OK, "noted")
+                self.expect("save", OK, "in force", **WRITES)
+            self.assertEqual(tool("rules", "discard")[0], OK)
+        self.assertEqual(tool("rules", "add", "--router-port", listed(443))[0], USAGE)
+        self.assertIn("1022 is the most", tool("rules", "add", "--router-port", listed(443))[2])
+
     def test_an_unreadable_file_is_left_alone(self):
         for text in ("\0\1 no rules\n", '[1]\nenabled="1"\n'):
             put(RULES, text)

@@ -358,4 +358,42 @@ TEST(Rules, AreTakenApartPairByPair) {
     }
 }
 
+// 204 ports take 1,019 bytes, so that the rest is what a cut leaves of the next ones.
+std::string LongList(const std::string& szRest) {
+    std::string szPorts;
+    for (int nPort = 1001; nPort < 1408; nPort += 2) {
+        szPorts += std::to_string(nPort) + ",";
+    }
+    return szPorts.substr(0, szPorts.size() - 1) + szRest;
+}
+
+TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
+    ASSERT_EQ(LongList("").size(), 1019U);
+    const struct {
+        std::string szRouter;
+        std::string szBox;
+        size_t nPairs;
+        bool blCut;
+    } rgCases[] = {
+        {LongList(",443"), LongList(",443"), 204, true},     // of 4433, perhaps
+        {LongList(",5-9"), LongList(",5-9"), 204, true},     // of 5-9000, perhaps
+        {LongList(",44,"), LongList(",44,"), 205, true},     // between two
+        {LongList(",443"), LongList(",44,45"), 204, true},   // the sides are cut at different places
+        {LongList(",44"), LongList(",44"), 205, false},      // a byte is left
+        {LongList(",4433"), LongList(",4433"), 205, false},  // written by hand, and whole
+    };
+    for (const auto& c : rgCases) {
+        const auto rgPairs = tavo::ExpandRule("tcp", c.szRouter, c.szBox);
+        ASSERT_TRUE(rgPairs) << c.szRouter;
+        EXPECT_EQ(rgPairs->size(), c.nPairs) << c.szRouter;
+        Write("/etc/tavoinfo.conf", "runupnpportmapping=\"yes\"\n");
+        Write("/etc/portforward/rule.conf",
+              "[1]\nenabled=1\nr_port=\"" + c.szRouter + "\"\ns_port=\"" + c.szBox + "\"\nprotocol name=tcp\n");
+        const tavo::WantedSet wanted = tavo::ReadWanted("runupnpportmapping");
+        EXPECT_EQ(wanted.rgMappings.size(), c.nPairs);
+        ASSERT_EQ(wanted.rgRefused.size(), c.blCut ? 1U : 0U);
+        EXPECT_TRUE(!c.blCut || wanted.rgRefused[0].verdict.szWord == "cut");
+    }
+}
+
 }  // namespace

@@ -5,8 +5,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <set>
+
 #include "HopLink.h"
 #include "network.h"
+#include "programs/common/Wanted.h"
 #include "stage.h"
 #include "tavo/core.h"
 #include "world.h"
@@ -176,7 +180,13 @@ TEST_F(RelayService, WhoKeepsAPort) {
          {}},
         {"E tcp 80 80 hop", "", "", {}},
         {"", "82-80/tcp", "1 E tcp 80-82 80-82 hop", {}},
+        // the first rule that has either port decides
+        {"E tcp 80 80; E tcp 80 81", "80/tcp", "1 E tcp 80 80; 2 E tcp 80 81", {}},
         // half an overlap decides nothing
+        {"E tcp 80,81 81,80",
+         "80/tcp",
+         nullptr,
+         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
         {"E tcp 8080 80",
          "80/tcp",
          nullptr,
@@ -211,6 +221,35 @@ TEST_F(RelayService, WhoKeepsAPort) {
         }
         EXPECT_EQ(Statuses(rgRequests), std::string(rgRequests.size(), '9'));
         EXPECT_TRUE(LockIsFree());
+    }
+}
+
+// The merge writes a user's list with a blank behind each comma, and what its record does not hold is lost.
+TEST_F(RelayService, WhatTheMergeCutsOpensNoPortThatNobodyWrote) {
+    for (const std::string szFirst :
+         {"1", "22", "333", "4444", "55555", "100-109"}) {  // the cut wanders through a number
+        SetUp();
+        std::string szPorts = szFirst;
+        for (int nPort = 20001; szPorts.size() + 6 < 1000; nPort += 2) {
+            szPorts += "," + std::to_string(nPort);
+        }
+        Write(kRuleConf, Stored("E tcp " + szPorts + " " + szPorts));
+        Write(kSystemConf, "runupnpportmapping=\"yes\"\n");
+        const auto fnWanted = [] {
+            std::set<int> wanted;
+            for (const auto& mapping : tavo::ReadWanted("runupnpportmapping").rgMappings) {
+                wanted.insert(mapping.nRouterPort);
+            }
+            return wanted;
+        };
+        const std::set<int> written = fnWanted();
+        Requests rgRequests = Ask("9/udp");
+        ASSERT_EQ(Set("hop", rgRequests), 0);
+        std::set<int> wanted = fnWanted();
+        EXPECT_EQ(wanted.erase(9), 1U);
+        EXPECT_GT(wanted.size(), 140U) << szFirst;
+        EXPECT_TRUE(std::includes(written.begin(), written.end(), wanted.begin(), wanted.end())) << szFirst;
+        ASSERT_EQ(tavo::ReadWanted("runupnpportmapping").rgRefused.size(), 1U);
     }
 }
 
@@ -252,6 +291,7 @@ struct SetFault {
 TEST_F(RelayService, EachStepThatFails) {
     const std::string szOld = Stored("E tcp 80 80; E tcp 81 81 hop");
     Requests rgRequests;
+    static const std::string szLong = std::string("10000-10001") + std::string(1002, ',') + "12,443,4433";
     const Lines noState = {"cannot get gateway router ip", "get gateway ip failed", "GetInitState() failed"};
     const SetFault rgFaults[] = {
         {"lock held",
@@ -297,6 +337,11 @@ TEST_F(RelayService, EachStepThatFails) {
          -1,
          {"Bad parameter, szProtocol=TCP", "ToProtocolEnum([0]=-1) failed",
           "CreateOperationRulesArray(ruleConf) failed"},
+         false},
+        {"a list that a record would cut",
+         [] { Write(kRuleConf, Stored("E tcp " + szLong + " " + szLong)); },
+         -1,
+         {"TAVOPFRuleGetByIdList() failed", "TLibGetRulesArrFromRuleConf() failed"},
          false},
         {"no port asked for",
          [&] { rgRequests = Ask("0/tcp"); },

@@ -17,6 +17,7 @@ extern "C" {
 
 enum {
     TAVO_PF_NAME_SIZE = 1024,
+    TAVO_PF_PORTS_SIZE = 1024, /* of a list of ports in the library's records, with the NUL */
     TAVO_PF_MAX_SECTIONS = 16384 /* of a file: a node has a kilobyte, and one of nothing but "[]" must not eat it all */
 };
 
@@ -47,7 +48,9 @@ void TAVOPFConfFree(TAVO_PF_CONF* pHead);
 TAVO_PF_CONF* TAVOPFRuleGet(void);
 TAVO_PF_CONF* TAVOPFTestRuleGet(void);
 /* The sections whose names stand in szIdList (separated by "," or blanks), in file order; NULL or an
- * empty list: all of them. NULL: as above, or nothing matches. */
+ * empty list: all of them. NULL: as above, or nothing matches, or one of them has a list of ports ("r_port",
+ * "s_port") that TAVO_PF_PORTS_SIZE does not hold: the records that are made of these sections would cut it, in the
+ * middle of a number perhaps, and name ports that nobody wrote. Which rule it is, is logged. */
 TAVO_PF_CONF* TAVOPFRuleGetByIdList(const char* szIdList);
 TAVO_PF_CONF* TAVOPFTestRuleGetByIdList(const char* szIdList);
 /* Writes the list as the whole file; a null list makes an empty file. 0: written; negative: failed. */

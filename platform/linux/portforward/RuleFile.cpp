@@ -26,6 +26,7 @@ constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr int kMaxPort = 65535;
+constexpr size_t kMostName = 60;  // of a rule, in a log line
 constexpr int kLoadTries = 8;
 constexpr useconds_t kOwnerMicroseconds = 20000;  // who holds a copy is about to write
 
@@ -83,6 +84,21 @@ bool IsListed(std::string_view szName, std::string_view szIdList) {
     return false;
 }
 
+// Whether records hold what a rule says of its ports. A cut list may end within a number.
+bool FitsRecords(const char* szPath, const TAVO_PF_CONF* pRule) {
+    for (const char* szKey : {"r_port", "s_port"}) {
+        if (Value(pRule, szKey).size() >= TAVO_PF_PORTS_SIZE) {
+            tavo::SysLog(LOG_ERR,
+                         "%s: the list of ports of rule %s is longer than %d bytes and would be cut: nothing "
+                         "is read, write it as two rules",
+                         szPath, tavo::PrintableText(pRule->szSection, kMostName).c_str(), TAVO_PF_PORTS_SIZE - 1);
+            TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
+            return false;
+        }
+    }
+    return true;
+}
+
 TAVO_PF_CONF* LoadListed(const char* szPath, const char* szIdList) {
     ConfList pList(Load(szPath));
     if (szIdList == nullptr || std::strspn(szIdList, ", \t") == std::strlen(szIdList)) {
@@ -99,6 +115,19 @@ TAVO_PF_CONF* LoadListed(const char* szPath, const char* szIdList) {
         pDropped->pNext = nullptr;
     }
     return pHead;
+}
+
+// All of them, or none where one does not fit.
+TAVO_PF_CONF* LoadForRecords(const char* szPath, const char* szIdList) {
+    return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&]() -> TAVO_PF_CONF* {
+        ConfList pList(LoadListed(szPath, szIdList));
+        for (const TAVO_PF_CONF* pRule = pList.get(); pRule != nullptr; pRule = pRule->pNext) {
+            if (!FitsRecords(szPath, pRule)) {
+                return nullptr;
+            }
+        }
+        return pList.release();
+    });
 }
 
 std::vector<tavo::Section> Sections(const TAVO_PF_CONF* pHead) {
@@ -173,11 +202,11 @@ TAVO_PF_CONF* TAVOPFTestRuleGet() {
 }
 
 TAVO_PF_CONF* TAVOPFRuleGetByIdList(const char* szIdList) {
-    return LoadListed(kRuleConf, szIdList);
+    return LoadForRecords(kRuleConf, szIdList);
 }
 
 TAVO_PF_CONF* TAVOPFTestRuleGetByIdList(const char* szIdList) {
-    return LoadListed(kTestRuleConf, szIdList);
+    return LoadForRecords(kTestRuleConf, szIdList);
 }
 
 int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
