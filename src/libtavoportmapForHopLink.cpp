@@ -172,8 +172,6 @@ bool ServiceRules::Save() {
         LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
         return false;
     }
-    mStored.Free();  // of wide ranges these lists are large, and the test makes them once more
-    mRequested.Free();
     char szGateway[TAVO_TEXT_SIZE] = {};
     if (TLibGetGatewayIP(szGateway, sizeof(szGateway)) != 0) {
         LogError("%s:%d get gateway ip failed", kHopLinkFile, __LINE__);

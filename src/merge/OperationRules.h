@@ -35,17 +35,13 @@ void FreeOperationRulesArray(OPERATION_RULE* rgRules, int nRules);
 template <typename Record, void (*pfnFree)(Record*, int)>
 struct OwnedArray {
     OwnedArray() = default;
-    ~OwnedArray() { Free(); }
+    ~OwnedArray() { pfnFree(rgRules, nRules); }
     OwnedArray(const OwnedArray&) = delete;
     OwnedArray& operator=(const OwnedArray&) = delete;
 
     void MoveTo(Record** pRgOutRules, int* pnOutRules) {
         *pRgOutRules = std::exchange(rgRules, nullptr);
         *pnOutRules = std::exchange(nRules, 0);
-    }
-    void Free() {
-        pfnFree(std::exchange(rgRules, nullptr), nRules);
-        nRules = 0;
     }
 
     Record* rgRules = nullptr;
