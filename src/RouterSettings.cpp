@@ -209,7 +209,8 @@ Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const Rou
     if (!SetAccount(writer, conf)) {
         return Stored::kRefused;
     }
-    const tavo::lib::OwnerAndMode old(kRouterConf);
+    tavo::lib::OwnerAndMode old(kRouterConf);
+    old.HideFromOthers();
     if (TLIBCFileExist(kRouterConf) == 1 && !RenameOrLog(kRouterConf, kRouterConfBak, __LINE__)) {
         return Stored::kRefused;
     }

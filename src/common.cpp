@@ -255,6 +255,12 @@ void FileLock::LeaveToParent() {
 
 OwnerAndMode::OwnerAndMode(const char* szPath) : mBlKnown(stat(szPath, &mStatus) == 0) {}
 
+void OwnerAndMode::HideFromOthers() {
+    if ((mStatus.st_mode & S_IRWXO) != 0) {
+        mStatus.st_mode &= ~static_cast<mode_t>(S_IRWXG | S_IRWXO);
+    }
+}
+
 void OwnerAndMode::GiveTo(const char* szPath) const {
     struct stat own = {};
     if (!mBlKnown || stat(szPath, &own) != 0) {

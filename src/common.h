@@ -114,6 +114,8 @@ class OwnerAndMode {
 public:
     explicit OwnerAndMode(const char* szPath);
     void GiveTo(const char* szPath) const;
+    // For a file that gets a password, and may not have had one: one that anybody could read is its owner's alone then.
+    void HideFromOthers();
 
 private:
     struct stat mStatus = {};

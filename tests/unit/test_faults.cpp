@@ -466,6 +466,15 @@ TEST_F(Faults, AReplacedFileKeepsOwnerAndMode) {
          }},
         {kSystemConf, [] { EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr), 1); }},
     };
+    // Settings that anybody could read are their owner's alone once they hold the password of a router's pages.
+    for (const auto& [szSupport, nMode] : {std::pair{"yes", 0644U}, {"no", 0600U}}) {
+        Write(kRouterConf, "");
+        chmod(kRouterConf, 0644);
+        CallAndDie({"", szSupport, 1, true});
+        struct stat status = {};
+        stat(kRouterConf, &status);
+        EXPECT_EQ(status.st_mode & 07777U, nMode) << szSupport;
+    }
     for (const auto& write : rgWrites) {
         SCOPED_TRACE(write.szFile);
         const char* szFile = write.szFile.c_str();
