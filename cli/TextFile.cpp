@@ -52,11 +52,9 @@ bool WriteAll(int fd, const std::string& szText) {
 }
 
 // A name in a directory lasts only when the directory has been written, too.
-void FlushDirectoryOf(const std::string& szPath) {
+bool FlushDirectoryOf(const std::string& szPath) {
     const File directory(open(szPath.substr(0, szPath.rfind('/') + 1).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (directory.Fd() >= 0) {
-        fsync(directory.Fd());
-    }
+    return directory.Fd() >= 0 && (fsync(directory.Fd()) == 0 || errno == EINVAL || errno == ENOTSUP);
 }
 
 }  // namespace
@@ -98,15 +96,13 @@ bool WriteOwnFile(const std::string& szPath, const std::string& szText) {
         unlink(szNew.c_str());
         return false;
     }
-    FlushDirectoryOf(szPath);
-    return true;
+    return FlushDirectoryOf(szPath);
 }
 
 bool RemoveOwnFile(const std::string& szPath) {
     const bool blGone = unlink(szPath.c_str()) == 0 || errno == ENOENT ||
                         (errno == EISDIR && std::rename(szPath.c_str(), (szPath + ".aside").c_str()) == 0);
-    FlushDirectoryOf(szPath);
-    return blGone;
+    return blGone && (FlushDirectoryOf(szPath) || errno == ENOENT);
 }
 
 }  // namespace tavo::cli

@@ -23,6 +23,7 @@ namespace {
 
 constexpr char kFile[] = "ground/TextFile.cpp";
 constexpr char kHexDigits[] = "0123456789abcdef";
+constexpr mode_t kDirectoryMode = 0755;
 
 bool Fail(int nErr, int nLine) {
     TLIBCErrSet(nErr, kFile, nLine);
@@ -239,12 +240,10 @@ std::string Resolve(const std::string& szPath) {
     return szReal ? szReal.get() : szPath;
 }
 
-// The new name must survive a power cut as well.
-void FlushDirectory(const std::string& szDir) {
+bool FlushDirectory(const std::string& szDir) {
     const Descriptor fd(open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (fd.Get() >= 0) {
-        fsync(fd.Get());
-    }
+    const bool blFlushed = fd.Get() >= 0 && (fsync(fd.Get()) == 0 || errno == EINVAL || errno == ENOTSUP);
+    return blFlushed || Fail(TLIBC_ERR_WRITE, __LINE__);
 }
 
 bool KeepOwnerAndMode(int fd, const std::string& szTarget, mode_t nNewMode) {
@@ -317,8 +316,18 @@ bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t 
     if (!file.Rename(szTarget)) {
         return Fail(TLIBC_ERR_RENAME, __LINE__);
     }
-    FlushDirectory(szDir);
-    return true;
+    return FlushDirectory(szDir);
+}
+
+bool FlushDirectoryOf(const std::string& szPath) {
+    return FlushDirectory(DirectoryOf(szPath));
+}
+
+bool MakeDirectory(const std::string& szDir) {
+    if (mkdir(szDir.c_str(), kDirectoryMode) != 0) {
+        return errno == EEXIST || Fail(TLIBC_ERR_OPEN, __LINE__);
+    }
+    return chmod(szDir.c_str(), kDirectoryMode) == 0 ? FlushDirectoryOf(szDir) : Fail(TLIBC_ERR_OPEN, __LINE__);
 }
 
 std::string_view Trim(std::string_view szText) {

@@ -1,6 +1,7 @@
 // The one reader and writer of the platform's text files: sectioned files and key files.
 // Relies on POSIX files only. Promises: what was written is read back unchanged, whatever it holds; a
-// reader never sees half a file; a failed write leaves the old file and nothing beside it.
+// reader never sees half a file; a failed write leaves the old file and nothing beside it; what was written
+// is there after a power cut.
 #pragma once
 
 #include <sys/types.h>
@@ -36,10 +37,19 @@ std::string DirectoryOf(const std::string& szPath);
 std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost = TLIBC_MAX_FILE);
 
 // Replaces szPath: new file in the same directory, flushed, owner and mode of the old one kept
-// (nNewMode for a new file), renamed over it. A link is followed. fnWhole is shown the new file while the old one
-// stands, and may refuse it. False with the last error set, also for a text of more than nMost bytes.
+// (nNewMode for a new file), renamed over it, its directory flushed. A link is followed. fnWhole is shown the new file
+// while the old one stands, and may refuse it. False with the last error set, also for a text of more than nMost bytes.
+// Where the disk does not flush the directory, the new file stands, and may be the old one after a power cut: false.
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode = kPrivateMode,
                      const std::function<bool(int fd)>& fnWhole = nullptr, size_t nMost = TLIBC_MAX_FILE);
+
+// What was made, renamed and deleted in the directory that the path leads into is there, or gone, after a power cut.
+// False with the last error set. A file system that flushes no directories is none that fails.
+bool FlushDirectoryOf(const std::string& szPath);
+
+// A directory for the box's state, 0755 whatever the umask is, and there after a power cut. True also when it was
+// there.
+bool MakeDirectory(const std::string& szDir);
 
 // All sections in file order; two of one name stay two. Nothing when any line is neither section, pair,
 // comment nor blank; pnBadLine, where given, is its number.

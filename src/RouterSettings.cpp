@@ -254,6 +254,7 @@ int FinishStoring(Stored enStored) {
             if (TLIBCFileExist(kRouterConfBak) == 1) {
                 RenameOrLog(kRouterConfBak, kRouterConf, __LINE__);
             }
+            tavo::lib::FlushDirectoryOf(kRouterConf);  // what was refused must not be in force after a power cut
             return -1;
         case Stored::kRefused:
             break;

@@ -272,6 +272,15 @@ void OwnerAndMode::GiveTo(const char* szPath) const {
     }
 }
 
+void FlushDirectoryOf(const char* szPath) {
+    const std::string szDir(szPath, std::string_view(szPath).rfind('/') + 1);
+    const int fd = open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd >= 0) {
+        fsync(fd);
+        close(fd);
+    }
+}
+
 HeldFile::HeldFile(const char* szPath) {
     if (TLIBCFileExist(szPath) == 1) {
         mFd = open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK);

@@ -122,6 +122,9 @@ private:
     bool mBlKnown;
 };
 
+// What was renamed and deleted in the directory of the file at szPath is so after a power cut, too.
+void FlushDirectoryOf(const char* szPath);
+
 // Holds the file at szPath locked, under whatever name it gets meanwhile, as long as the object and the process live:
 // readers bring back what a killed writer set aside, and leave alone what is held.
 class HeldFile {

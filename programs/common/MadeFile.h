@@ -13,7 +13,7 @@ public:
     explicit MadeFile(const char* szPath)
         : mFile(szPath, "mappings may outlive a crash", kMostMappingsText), mRecord(mFile.Read(), BootId()) {}
     Record& Get() { return mRecord; }
-    void Save() { mFile.Save(mRecord.Text()); }
+    bool Save() { return mFile.Save(mRecord.Text()); }
 
 private:
     StateFile mFile;

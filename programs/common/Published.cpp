@@ -2,7 +2,6 @@
 #include "programs/common/Published.h"
 
 #include <json/json.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include "ground/SysLog.h"
@@ -13,7 +12,6 @@ namespace tavo {
 namespace {
 
 constexpr char kDirectory[] = "/run/tavo";
-constexpr mode_t kDirectoryMode = 0755;
 constexpr mode_t kFileMode = 0644;
 
 std::string PathOf(const std::string& szDaemon) {
@@ -133,8 +131,7 @@ std::string ToJson(const Published& state) {
 }
 
 void Publish(const Published& state) {
-    mkdir(kDirectory, kDirectoryMode);
-    if (!WriteFileAtomic(PathOf(state.szDaemon), ToJson(state), kFileMode)) {
+    if (!MakeDirectory(kDirectory) || !WriteFileAtomic(PathOf(state.szDaemon), ToJson(state), kFileMode)) {
         SysLog(LOG_ERR, "cannot write %s", PathOf(state.szDaemon).c_str());
     }
 }

@@ -1,8 +1,6 @@
 // See StateFile.h.
 #include "programs/common/StateFile.h"
 
-#include <sys/stat.h>
-
 #include <utility>
 
 #include "ground/Paths.h"
@@ -17,16 +15,21 @@ const std::string& StateFile::Read() {
     return mSzWritten;
 }
 
-void StateFile::Save(std::string szText) {
-    if (szText == mSzWritten) {
-        return;
+bool StateFile::Save(std::string szText) {
+    if (szText == mSzWritten && !mBlFailed) {
+        return true;
     }
-    mkdir(kStateDir, 0755);
-    if (!WriteFileAtomic(mSzPath, szText, kPrivateMode, nullptr, mNMost)) {
+    const bool blWritten = MakeDirectory(kStateDir) && WriteFileAtomic(mSzPath, szText, kPrivateMode, nullptr, mNMost);
+    if (!blWritten && !mBlFailed) {
         SysLog(LOG_ERR, "cannot write %s: %s", mSzPath.c_str(), mSzLoss);
-        return;
+    } else if (blWritten && mBlFailed) {
+        SysLog(LOG_NOTICE, "%s can be written again", mSzPath.c_str());
     }
-    mSzWritten = std::move(szText);
+    mBlFailed = !blWritten;
+    if (blWritten) {
+        mSzWritten = std::move(szText);
+    }
+    return blWritten;
 }
 
 }  // namespace tavo

@@ -1,6 +1,6 @@
 // A text below /var/lib/tavo that a daemon keeps for its next start. Relies on the platform's text files.
-// Promises: what Save() wrote is there after a crash; nothing is written that has not changed; a file that is missing
-// or unreadable is an empty text.
+// Promises: what Save() wrote is there after a crash or a power cut; nothing is written that has not changed; a failure
+// is logged when it begins, and again only after a success; a file that is missing or unreadable is an empty text.
 #pragma once
 
 #include <string>
@@ -15,13 +15,15 @@ public:
     StateFile(std::string szPath, const char* szLoss, size_t nMost = TLIBC_MAX_FILE)
         : mSzPath(std::move(szPath)), mSzLoss(szLoss), mNMost(nMost) {}
     const std::string& Read();
-    void Save(std::string szText);
+    // Whether the text is on the disk.
+    bool Save(std::string szText);
 
 private:
     std::string mSzPath;
     const char* mSzLoss;
     size_t mNMost;
     std::string mSzWritten;
+    bool mBlFailed = false;  // nobody knows what the file holds
 };
 
 // Some 300 bytes for each port of both protocols, and room for long texts.

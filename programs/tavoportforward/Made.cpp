@@ -1,8 +1,6 @@
 // Keeps the record of made mappings. Relies on TextFile. Promises: see Made.h.
 #include "programs/tavoportforward/Made.h"
 
-#include <sys/stat.h>
-
 #include <algorithm>
 #include <charconv>
 
@@ -16,7 +14,6 @@ namespace tavo {
 namespace {
 
 constexpr char kRecord[] = "/var/lib/tavo/manual_router.made";
-constexpr mode_t kDirectoryMode = 0755;
 
 std::string Get(const Section& section, const char* szKey) {
     const auto it = std::find_if(section.rgPairs.begin(), section.rgPairs.end(),
@@ -92,8 +89,7 @@ bool MadeJobs::Write() const {
                                {"box_first", std::to_string(job.nBoxFirst)},
                                {"name", job.szName}}});
     }
-    mkdir(kStateDir, kDirectoryMode);
-    const bool blWritten = WriteFileAtomic(kRecord, FormatSections(rgSections));
+    const bool blWritten = MakeDirectory(kStateDir) && WriteFileAtomic(kRecord, FormatSections(rgSections));
     if (!blWritten) {
         SysLog(LOG_ERR, "cannot write %s", kRecord);
     }

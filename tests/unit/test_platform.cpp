@@ -1,5 +1,4 @@
 // The platform: files that survive any value and any failure, processes, port lists, the database.
-#include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -19,38 +18,6 @@
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 #include "world.h"
-
-namespace {
-
-std::string gSzForeign;    // the file that another user owns; it takes no such user
-int gNRenamesLeft = -1;    // before the process is killed; below 0: it is not
-bool gBlExchanges = true;  // the file system can exchange two names
-
-}  // namespace
-
-extern "C" int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsigned nFlags) noexcept {
-    static const auto fnReal =
-        reinterpret_cast<int (*)(int, const char*, int, const char*, unsigned)>(dlsym(RTLD_NEXT, "renameat2"));
-    if (gNRenamesLeft >= 0 && gNRenamesLeft-- == 0) {
-        raise(SIGKILL);
-    }
-    if (nFlags == RENAME_EXCHANGE && !gBlExchanges) {
-        errno = EINVAL;
-        return -1;
-    }
-    return fnReal(fdFrom, szFrom, fdTo, szTo, nFlags);
-}
-
-extern "C" int fstat(int fd, struct stat* pStatus) noexcept {
-    static const auto fnReal = reinterpret_cast<int (*)(int, struct stat*)>(dlsym(RTLD_NEXT, "fstat"));
-    const int nResult = fnReal(fd, pStatus);
-    std::error_code error;
-    if (!gSzForeign.empty() &&
-        std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), error) == gSzForeign) {
-        pStatus->st_uid = 1000;
-    }
-    return nResult;
-}
 
 namespace {
 

@@ -40,13 +40,13 @@ bool AllocationFails() {
     return true;
 }
 
-void Change() {
+}  // namespace
+
+void ChangeName() {
     if (gNGoodChanges >= 0 && gNGoodChanges-- == 0) {
         _exit(kKilled);
     }
 }
-
-}  // namespace
 
 #ifdef __SANITIZE_ADDRESS__
 void* operator new(size_t nSize) {
@@ -87,22 +87,6 @@ void syslog(int /*nPriority*/, const char* szFormat, ...) {
     va_end(args);
     const std::string szText = szLine;
     gLog.push_back(szText.substr(szText.find(' ') + 1));
-}
-
-int unlink(const char* szPath) noexcept {
-    Change();
-    static const auto fnReal = reinterpret_cast<int (*)(const char*)>(dlsym(RTLD_NEXT, "unlink"));
-    return fnReal(szPath);
-}
-
-int rename(const char* szFrom, const char* szTo) {
-    Change();
-    if (gSzFailRename == szFrom) {
-        gSzFailRename.clear();
-        return -1;
-    }
-    static const auto fnReal = reinterpret_cast<int (*)(const char*, const char*)>(dlsym(RTLD_NEXT, "rename"));
-    return fnReal(szFrom, szTo);
 }
 
 int TAVOGwRouterConfSet(const TAVO_PF_CONF* pHead) {

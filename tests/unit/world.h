@@ -19,6 +19,13 @@ extern std::string gSzFailRename;
 // After so many changes of a name or a file's rights the process dies at the next one (never: negative).
 extern int gNGoodChanges;
 inline constexpr int kKilled = 77;
+// Renames by renameat2 before the process is killed (never: negative), and whether the file system exchanges names.
+extern int gNRenamesLeft;
+extern bool gBlExchanges;
+// The file that another user owns; it takes no such user.
+extern std::string gSzForeign;
+// Of the stand-ins: a name is about to change.
+void ChangeName();
 // The default gateway that the platform reports; empty: none.
 extern std::string gSzGateway;
 // Seconds slept; sleep() only counts.

@@ -3,12 +3,12 @@
 #include "wire/upnp/GatewayMemory.h"
 
 #include <netinet/in.h>
-#include <sys/stat.h>
 
 #include <memory>
 
 #include "ground/Paths.h"
 #include "ground/SysLog.h"
+#include "ground/TextFile.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
 
@@ -35,7 +35,7 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     if (before.szLocation == router.szLocation && before.blPermanentOnly == router.blPermanentOnly) {
         return;
     }
-    mkdir(kStateDir, 0755);
+    MakeDirectory(kStateDir);
     const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(2), &TLIBCSzHashFree);
     TLIBCSzHashSetValue(pHash.get(), "location", router.szLocation.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");

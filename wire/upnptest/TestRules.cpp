@@ -4,7 +4,6 @@
 
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -56,8 +55,7 @@ bool SaveTestRules(const std::vector<TestRule>& rgRules) {
                                {"enabled", rule.blKept ? "1" : "0"},
                                {"result", rule.szResult}}});
     }
-    mkdir(kStateDir, 0755);
-    return WriteFileAtomic(kTestRules, FormatSections(rgSections));
+    return MakeDirectory(kStateDir) && WriteFileAtomic(kTestRules, FormatSections(rgSections));
 }
 
 bool RemoveTestRules() {

@@ -33,7 +33,6 @@ using tavo::kStateDir;
 using tavo::ReadFile;
 
 constexpr char kRecord[] = "/var/lib/tavo/run_keys.conf";
-constexpr mode_t kDirectoryMode = 0755;
 constexpr off_t kMaxRecord = 4096;
 constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
@@ -285,7 +284,7 @@ int TAVORunKeysRemember() {
         if (const int nMended = before && IsOurs(*before) ? 0 : MendLocked(); nMended != 0) {
             return nMended;
         }
-        if (mkdir(kStateDir, kDirectoryMode) != 0 && errno != EEXIST) {
+        if (!tavo::MakeDirectory(kStateDir)) {
             return -1;
         }
         if (!OwnText()) {

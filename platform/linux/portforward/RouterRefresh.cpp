@@ -170,15 +170,17 @@ bool Swap(const fs::path& fresh) {
         return false;
     }
     if (tavo::Rename(fresh.c_str(), kDatabase, RENAME_EXCHANGE)) {
-        return true;  // the old one goes with the scratch
+        // The old one goes with the scratch, and must not lie in its place again half deleted.
+        return tavo::FlushDirectoryOf(kDatabase) || (tavo::Rename(fresh.c_str(), kDatabase, RENAME_EXCHANGE), false);
     }
     if (errno == ENOENT) {
-        return tavo::Rename(fresh.c_str(), kDatabase, 0);
+        return tavo::Rename(fresh.c_str(), kDatabase, 0) && tavo::FlushDirectoryOf(kDatabase);
     }
     // A file system that exchanges nothing: between the two steps, whoever looks brings the old one back.
     std::error_code error;
     fs::remove_all(kDatabaseAside, error);
-    const bool blDone = tavo::Rename(kDatabase, kDatabaseAside, 0) && tavo::Rename(fresh.c_str(), kDatabase, 0);
+    const bool blDone = tavo::Rename(kDatabase, kDatabaseAside, 0) && tavo::Rename(fresh.c_str(), kDatabase, 0) &&
+                        tavo::FlushDirectoryOf(kDatabase);
     if (blDone) {
         fs::remove_all(kDatabaseAside, error);
     } else {

@@ -5,7 +5,6 @@
 #include "tavo/task.h"
 
 #include <json/json.h>
-#include <sys/stat.h>
 
 #include <map>
 #include <new>
@@ -20,7 +19,6 @@ namespace {
 constexpr char kFile[] = "platform/linux/task/Task.cpp";
 constexpr char kTaskDirectory[] = "/var/lib/tavo/tasks";
 constexpr char kSuffix[] = ".json";
-constexpr mode_t kDirectoryMode = 0755;
 constexpr mode_t kRecordMode = 0644;  // other processes, of whatever user, read the records
 constexpr size_t kMaxName = 200;      // with suffixes still a file name
 constexpr size_t kMaxRecord = 1U << 20U;
@@ -45,13 +43,6 @@ bool IsName(const std::string& szName) {
 
 std::string OwnerDirectory(const std::string& szOwner) {
     return std::string(kTaskDirectory) + "/" + szOwner;
-}
-
-// mkdir alone would leave it to the caller's umask who may look inside.
-void MakeDirectory(const std::string& szPath) {
-    if (mkdir(szPath.c_str(), kDirectoryMode) == 0) {
-        chmod(szPath.c_str(), kDirectoryMode);
-    }
 }
 
 // Without a byte 0, which would cut it for every C reader.
@@ -121,7 +112,7 @@ struct Task::Impl {
         }
         for (const std::string& szDirectory :
              {std::string(kStateDir), std::string(kTaskDirectory), OwnerDirectory(szOwner)}) {
-            MakeDirectory(szDirectory);
+            tavo::MakeDirectory(szDirectory);
         }
         return tavo::WriteFileAtomic(szPath, szText, kRecordMode) ? 1 : 0;
     }
