@@ -370,6 +370,24 @@ std::optional<std::vector<Section>> ParseSections(std::string_view szText, size_
     return rgSections;
 }
 
+std::vector<Section> ReadableSections(std::string_view szText, size_t* pnLost) {
+    std::vector<Section> rgAll;
+    size_t nLost = 0;
+    while (!szText.empty()) {
+        const size_t nEnd = szText.find("\n\n");
+        std::optional<std::vector<Section>> rgSections = ParseSections(szText.substr(0, nEnd));
+        nLost += rgSections ? 0 : 1;
+        for (Section& section : rgSections ? *rgSections : std::vector<Section>()) {
+            rgAll.push_back(std::move(section));
+        }
+        szText.remove_prefix(nEnd == std::string_view::npos ? szText.size() : nEnd + 2);
+    }
+    if (pnLost != nullptr) {
+        *pnLost = nLost;
+    }
+    return rgAll;
+}
+
 std::optional<std::vector<Section>> LoadSections(const std::string& szPath) {
     const std::optional<std::string> szText = ReadFile(szPath);
     if (!szText) {

@@ -54,6 +54,9 @@ bool MakeDirectory(const std::string& szDir);
 // All sections in file order; two of one name stay two. Nothing when any line is neither section, pair,
 // comment nor blank; pnBadLine, where given, is its number.
 std::optional<std::vector<Section>> ParseSections(std::string_view szText, size_t* pnBadLine = nullptr);
+// What can be read of a text whose sections are parted by blank lines, as FormatSections() writes it: of a part with a
+// line that is none, nothing. pnLost, where given, is the number of such parts.
+std::vector<Section> ReadableSections(std::string_view szText, size_t* pnLost = nullptr);
 // The same for a file; the line that spoils it is logged.
 std::optional<std::vector<Section>> LoadSections(const std::string& szPath);
 // All pairs that stand under that name, in file order: a section that was begun again goes on.

@@ -22,19 +22,6 @@ Number NumberIn(const std::string& szText) {
     return nValue;
 }
 
-// The sections of a text whose parts are parted by blank lines. A part that cannot be read is left out.
-std::vector<Section> ReadableSections(std::string_view szText) {
-    std::vector<Section> rgAll;
-    while (!szText.empty()) {
-        const size_t nEnd = szText.find("\n\n");
-        for (Section& section : ParseSections(szText.substr(0, nEnd)).value_or(std::vector<Section>())) {
-            rgAll.push_back(std::move(section));
-        }
-        szText.remove_prefix(nEnd == std::string_view::npos ? szText.size() : nEnd + 2);
-    }
-    return rgAll;
-}
-
 }  // namespace
 
 Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(szBoot)) {

@@ -108,7 +108,7 @@ std::string FormatTold(const Told& told) {
 
 Told ParseTold(const std::string& szText) {
     Told told;
-    for (const Section& section : ParseSections(szText).value_or(std::vector<Section>())) {
+    for (const Section& section : ReadableSections(szText)) {
         Values mapValues;
         for (const Pair& pair : section.rgPairs) {
             mapValues[pair.szKey] = pair.szValue;

@@ -1,6 +1,5 @@
 // What a user has been told, kept over restarts of a daemon and of the box. Relies on a sectioned file below
-// /var/lib/tavo. Promises: a file that is missing or damaged is "nothing told yet"; nothing is written that has not
-// changed.
+// /var/lib/tavo. Promises: what is missing or damaged is "not told yet"; nothing is written that has not changed.
 #pragma once
 
 #include <string>

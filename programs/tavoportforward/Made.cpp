@@ -36,12 +36,13 @@ MadeJobs::MadeJobs(std::string szGateway, std::string szBox)
         return;
     }
     const auto szText = ReadFile(kRecord);
-    const auto rgSections = szText ? ParseSections(*szText) : std::nullopt;
-    if (!rgSections) {
-        SysLog(LOG_ERR, "%s cannot be read: mappings made earlier are not known by it", kRecord);
-        return;
+    size_t nLost = 0;
+    const std::vector<Section> rgSections = ReadableSections(szText.value_or(""), &nLost);
+    if (!szText || nLost != 0) {
+        SysLog(LOG_ERR, "%s cannot be read%s: mappings made earlier are not known by it", kRecord,
+               szText ? " as a whole" : "");
     }
-    for (const Section& section : *rgSections) {
+    for (const Section& section : rgSections) {
         Job job{Get(section, "protocol"), GetPort(section, "router_first"), GetPort(section, "router_last"),
                 GetPort(section, "box_first"), Get(section, "name")};
         if (job.nRouterFirst != 0 && job.nRouterFirst <= job.nRouterLast) {

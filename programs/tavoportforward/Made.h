@@ -19,7 +19,7 @@ struct MadeJob {
 
 class MadeJobs {
 public:
-    // A record that is missing or damaged counts as empty; the latter is logged.
+    // Of a damaged record the rows that can be read count; that is logged.
     MadeJobs(std::string szGateway, std::string szBox);
 
     // Those at this gateway.
