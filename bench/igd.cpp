@@ -111,9 +111,10 @@ int Map(tavo::Igd& igd, const std::string& szBox, int nPorts) {
     // As upnpd remembers what it made.
     tavo::Record record(tavo::ReadFile(kRecord).value_or(""), "bench");
     record.TurnTo({"the gateway", ""});
-    const tavo::PassResult result = tavo::BringInLine(
-        router, rgWanted, record, habit,
-        {szBox, tavo::BootSeconds, [] { return false; }, [&record] { tavo::WriteFileAtomic(kRecord, record.Text()); }});
+    const tavo::PassResult result =
+        tavo::BringInLine(router, rgWanted, record, habit,
+                          {szBox, tavo::BootSeconds, [] { return false; },
+                           [&record] { return tavo::WriteFileAtomic(kRecord, record.Text()); }});
     int nMissing = 0;
     for (const tavo::Outcome& outcome : result.rgOutcomes) {
         if (outcome.verdict.szWord != "1") {

@@ -7,6 +7,7 @@
 #include <iterator>
 #include <limits>
 #include <map>
+#include <optional>
 #include <utility>
 
 #include "mapping/Plan.h"
@@ -27,6 +28,7 @@ constexpr char kWritten[] = "written";  // the router said yes, and has not show
 constexpr char kLost[] = "lost";        // the router said yes, and does not show it
 constexpr size_t kMaxDescription = 64;  // of somebody else's entry
 constexpr int64_t kRenewAgain = 60;     // seconds after a renewal that was refused
+constexpr int64_t kRecordAgain = 60;    // seconds after the record could not be written
 constexpr int64_t kAskAgain = 10;       // seconds after an answer that did not come
 constexpr int64_t kLeastPause = 5;      // seconds between passes, whatever leases a router gives
 constexpr int64_t kNever = std::numeric_limits<int64_t>::max();
@@ -36,11 +38,12 @@ struct Place {
     const RouterMapping* pWanted = nullptr;
     Seen enSeen = Seen::kUnknown;
     RouterMapping entry = {};
-    bool blWritten = false;   // asked for in this pass, and not read back yet
-    bool blReplaced = false;  // taken away, because the router said yes to a change and did not make it
-    RouterReply kept = {};    // the router's word for what it did not take away
-    RouterReply answer = {};  // to the last asking for it
-    const char* szWhy = "";   // it was asked for
+    bool blWritten = false;     // asked for in this pass, and not read back yet
+    bool blUnrecorded = false;  // what was to be asked for cannot be put on record
+    bool blReplaced = false;    // taken away, because the router said yes to a change and did not make it
+    RouterReply kept = {};      // the router's word for what it did not take away
+    RouterReply answer = {};    // to the last asking for it
+    const char* szWhy = "";     // it was asked for
     Verdict verdict = {};
 };
 
@@ -69,6 +72,8 @@ private:
     void TakeAway(const std::vector<MappingKey>& rgKeys);
     bool Remove(const MappingKey& key, Place& place);
     bool Intend(const MappingKey& key, const Place& place);
+    void Forgo(const MappingKey& key, const std::optional<Made>& before);
+    bool Unrecorded(Place& place);
     void NoteIntents(const std::vector<MappingKey>& rgKeys);
     size_t Clear(std::vector<MappingKey> rgKeys);
     size_t Bring(std::vector<MappingKey> rgKeys);
@@ -243,22 +248,46 @@ bool Pass::Intend(const MappingKey& key, const Place& place) {
     return blNews;
 }
 
+// What cannot be put on record is not asked for, and what the record said before stands.
+void Pass::Forgo(const MappingKey& key, const std::optional<Made>& before) {
+    mRecord.Here().erase(key);
+    if (before) {
+        mRecord.Here().emplace(key, *before);
+    }
+    mMapPlaces[key].blUnrecorded = true;
+}
+
+bool Pass::Unrecorded(Place& place) {
+    if (place.blUnrecorded) {
+        place.verdict = {PortState::kRefused, kUnrecorded};
+        Wake(mAround.fnNow() + kRecordAgain);
+    }
+    return place.blUnrecorded;
+}
+
 // A crash between this and the answers leaves nothing that nobody knows of.
 void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
     bool blNews = false;
+    std::vector<std::pair<MappingKey, std::optional<Made>>> rgBefore;
     for (const MappingKey& key : rgKeys) {
         const Place& place = mMapPlaces[key];
         const Action enAction = StepFor(key, place).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
-            blNews = Intend(key, place) || blNews;
+            const Made* pMade = MadeAt(key);
+            std::optional<Made> before = pMade == nullptr ? std::nullopt : std::optional(*pMade);
+            if (Intend(key, place)) {
+                rgBefore.emplace_back(key, std::move(before));
+            }
         } else if (enAction == Action::kRenew && MadeAt(key) == nullptr) {  // made before there was a record
             mRecord.Here()[key] = {
                 mAround.szBox, place.entry.nBoxPort, place.entry.szDescription, true, place.entry.nLease, 0, true};
             blNews = true;
         }
     }
-    if (blNews) {
-        mAround.fnSave();
+    if ((blNews || !rgBefore.empty()) && !mAround.fnSave()) {
+        for (const auto& [key, before] : rgBefore) {
+            Forgo(key, before);
+        }
     }
 }
 
@@ -301,13 +330,16 @@ bool Pass::Do(const MappingKey& key, Place& place, const Step& step) {
             return !Look(key, place).IsSilence();
         case Action::kAdd:
             place.szWhy = step.szWhy;
-            return Add(key, place, true);
+            return !Unrecorded(place) && Add(key, place, true);
         case Action::kRenew:
             return Renew(key, place);
         case Action::kChange:
+            if (Unrecorded(place)) {
+                return false;
+            }
             place.szWhy = step.szWhy;
             Add(key, place, true);
-            if (place.blWritten || IsOver()) {
+            if (place.blWritten || place.blUnrecorded || IsOver()) {
                 return false;
             }
             [[fallthrough]];
@@ -362,8 +394,13 @@ bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
     }
     RouterMapping mapping = *place.pWanted;
     mapping.szClient = mAround.szBox;
-    if (blAnew && Intend(key, place)) {  // what nobody knew before: the router did not answer at first
-        mAround.fnSave();
+    const Made* pBefore = MadeAt(key);
+    const std::optional<Made> before = pBefore == nullptr ? std::nullopt : std::optional(*pBefore);
+    // What nobody knew before: the router did not answer at first.
+    if (blAnew && Intend(key, place) && !mAround.fnSave()) {
+        Forgo(key, before);
+        Unrecorded(place);
+        return false;
     }
     const int64_t nAsked = mAround.fnNow();
     const RouterReply& reply = place.answer = Note(AddWithLease(mRouter, mapping, mHabit));

@@ -1,6 +1,7 @@
 // Brings a router's table in line with the wanted mappings: looks, has every place decided, does it, looks again.
 // Relies on a Router, a Record and the Plan. Promises: mappings of other hosts and of other programs are never
-// touched; every mapping is on record before the router is asked for it; one counts as there only when the router
+// touched; every mapping is on record before the router is asked for it, and what cannot be put there is not asked for,
+// while what stands there is renewed; one counts as there only when the router
 // showed it (or granted it, where it cannot show any), and as gone only when the router says so; ends soon after fnStop
 // answers true or the limit has passed.
 #pragma once
@@ -35,7 +36,7 @@ struct Surroundings {
     std::string szBox;               // the box's own address
     std::function<int64_t()> fnNow;  // seconds of boot time
     std::function<bool()> fnStop;
-    std::function<void()> fnSave;  // puts the record where it survives us
+    std::function<bool()> fnSave;  // puts the record where it survives us; whether it is there
     // Is told of each step that changes something at the router, and why.
     std::function<void(const RouterMapping&, const Step&)> fnTell = [](const RouterMapping&, const Step&) {};
 };

@@ -24,6 +24,7 @@ constexpr std::pair<std::string_view, const char*> kWhy[] = {
      "the list of ports is so long that it may have lost its end, and the last of them are not asked for; write it as "
      "two rules"},
     {"duplicate", "an earlier rule sends this port to another port of the box"},
+    {kUnrecorded, "this box cannot note down what it opens, and opens nothing new; is its disk full ('df /var/lib')?"},
     {"noigd", "the gateway offers no UPnP port mapping"},
     {"nogateway", "there is no gateway"},
     {"busy", "the other daemon has not taken its mappings away yet"},

@@ -63,6 +63,9 @@ struct Outcome {
 };
 using OutcomeList = std::vector<Outcome>;
 
+// The word for what was not asked for, because the box could not have remembered it.
+inline constexpr char kUnrecorded[] = "unrecorded";
+
 // "5000/tcp", as a user reads it.
 std::string MappingName(const RouterMapping& mapping);
 // What became of a mapping.

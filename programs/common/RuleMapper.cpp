@@ -113,7 +113,7 @@ bool RuleMapper::OnNetworkChange() {
 }
 
 Surroundings RuleMapper::Around(const std::function<bool()>& fnStop, MadeFile& made) const {
-    return {mSzBox, BootSeconds, fnStop, [&made] { made.Save(); },
+    return {mSzBox, BootSeconds, fnStop, [&made] { return made.Save(); },
             [](const RouterMapping& mapping, const Step& step) {
                 const bool blOpened = step.enAction == Action::kAdd;
                 SysLog(LOG_INFO, "%s %s %s:%u: %s", MappingName(mapping).c_str(),

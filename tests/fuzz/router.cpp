@@ -169,7 +169,7 @@ void Map(tavo::Igd& igd) {
     tavo::Habits habit;
     tavo::Record record("", "boot");
     const tavo::PassResult result =
-        tavo::BringInLine(router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] {}});
+        tavo::BringInLine(router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] { return true; }});
     Require(result.rgOutcomes.size() >= rgWanted.size(), "every mapping has a status");
     for (size_t i = 0; i < result.rgOutcomes.size(); ++i) {
         const std::string& szStatus = result.rgOutcomes[i].verdict.szWord;

@@ -86,9 +86,6 @@ private:
 
     // The process begins anew with what is on the disk, perhaps after a boot.
     void Start() {
-        if (std::exchange(mBlStale, false)) {
-            OrphanAll();
-        }
         mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
         mHabit = {};
         mMapLives.clear();
@@ -107,12 +104,6 @@ private:
             entry.blOrphan = entry.blOrphan || entry.blBox;
             entry.blBox = false;
         }
-    }
-    // Dead with a disk that could not be written: what it says is out of date.
-    void OrphanAll() {
-        Orphan(mRouter.mMapTable);
-        Orphan(mMapOther);
-        mSzDisk.clear();
     }
     tavo::RouterName Name() const { return {"192.168.1.1", !mBlHardware ? "" : mBlOther ? "bb" : "aa"}; }
 
@@ -240,7 +231,7 @@ private:
             Ask();
             result = tavo::BringInLine(mRouter, mRgWanted, *mPRecord, mHabit,
                                        {mRouter.szBox, [this] { return mNNow - mNBootAt; },
-                                        [this] { return mNStopIn > 0 && --mNStopIn == 0; }, [this] { Save(); }});
+                                        [this] { return mNStopIn > 0 && --mNStopIn == 0; }, [this] { return Save(); }});
         } catch (const model::Killed&) {
             mRouter.nKillPerMille = 0;
             mNStopIn = 0;
@@ -292,19 +283,19 @@ private:
         mBlDoubtful = !blHeard;
     }
 
-    void Save() {
-        mBlStale = mBlDiskFull;
+    bool Save() {
         if (!mBlDiskFull) {
             mSzDisk = mPRecord->Text();
         }
+        return !mBlDiskFull;
     }
 
-    // Every mapping is on record before the router is asked.
+    // Every mapping is on record before the router is asked, and what cannot be put there is not asked for.
     void CheckOnRecord(const MappingKey& key) {
         ++mNAdds;
         tavo::Record disk(mSzDisk, "");
         disk.TurnTo(Name());
-        if (!mBlDiskFull && !disk.Here().contains(key)) {
+        if (!disk.Here().contains(key)) {
             Broken("asked for and not on record", key);
         }
     }
@@ -406,7 +397,8 @@ private:
             const bool blWaits =
                 mRouter.habits.blBlind && (mHabit.mapElsewhere.contains(key) ||
                                            (made != mPRecord->Here().end() && made->second.szClient != mRouter.szBox));
-            if (blFree && !blWaits && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
+            const bool blForgone = mBlDiskFull && result.rgOutcomes[i].verdict.szWord == tavo::kUnrecorded;
+            if (blFree && !blWaits && !blForgone && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
                 Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
             }
         }
@@ -432,7 +424,6 @@ private:
     std::vector<RouterMapping> mRgWanted;
     bool mBlHardware = true;  // the routers can be told apart
     bool mBlDiskFull = false;
-    bool mBlStale = false;          // the disk has not taken the newest record
     bool mBlAllOpen = false;        // at the last pass whose cost was looked at
     int mNStopIn = 0;               // looks at the stop until there is one; 0: there is none
     int mNAdds = 0;                 // of this pass
