@@ -1,12 +1,12 @@
 // One instance of a program on this box, told by a lock that it holds.
-// Relies on flock. Promises: a pid counts only while its process holds the lock, whatever file is left over.
+// Relies on FileLock. Promises: a pid counts only while its process holds the lock, whatever file is left over.
 #pragma once
 
 #include <sys/types.h>
 
 #include <string>
 
-#include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 
 namespace tavo {
 
@@ -17,7 +17,7 @@ public:
     // Makes this process the one instance, until the object goes. False: another process is.
     bool Take();
     // Leaves the lock to a parent that shares it.
-    void Forget() { mFd.Reset(); }
+    void Forget() { mLock.Release(); }
     // The process that is the instance now; 0 where none is, -1 where it does not say which it is.
     pid_t Holder() const;
 
@@ -25,7 +25,7 @@ public:
 
 private:
     std::string mSzLockFile;
-    Descriptor mFd;
+    FileLock mLock;
 };
 
 }  // namespace tavo

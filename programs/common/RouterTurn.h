@@ -1,11 +1,11 @@
 // Whose turn it is at the router. The two daemons may ask one router for one and the same mapping; were
 // one still taking its own away while the other makes its own, a mapping just made would vanish.
-// Relies on flock: a daemon that is killed gives its turn back. Promises: bounded waiting.
+// Relies on FileLock: a daemon that is killed gives its turn back. Promises: bounded waiting.
 #pragma once
 
 #include <functional>
 
-#include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 
 namespace tavo {
 
@@ -13,10 +13,10 @@ class RouterTurn {
 public:
     // Takes the turn or keeps it. Waits while the other daemon has it and fnWait answers true.
     bool Take(const std::function<bool()>& fnWait);
-    void GiveBack() { mFd.Reset(); }
+    void GiveBack() { mLock.Release(); }
 
 private:
-    Descriptor mFd;
+    FileLock mLock;
 };
 
 }  // namespace tavo

@@ -1,13 +1,11 @@
 // The publisher of AirPort base stations. Relies on AirportPublisher. Promises: stays in the foreground;
 // ends on SIGTERM and takes its file away.
-#include <fcntl.h>
-#include <sys/file.h>
 #include <syslog.h>
 
 #include <cstdio>
 #include <cstring>
 
-#include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "ground/SysLog.h"
 #include "programs/tavoairportd/Publisher.h"
 
@@ -31,8 +29,8 @@ int main(int argc, char** argv) {
     }
     openlog("tavoairportd", LOG_PID, LOG_DAEMON);
     // A second one would take the list of the first away when it ends.
-    const tavo::Descriptor fdLock(open(kLock, O_RDWR | O_CREAT | O_CLOEXEC, 0600));
-    if (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
+    const tavo::FileLock lock(kLock);
+    if (!lock.Try()) {
         tavo::SysLog(LOG_ERR, "another tavoairportd is running (lock %s)", kLock);
         return 1;
     }

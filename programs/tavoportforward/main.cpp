@@ -3,7 +3,6 @@
 // forward that is not in place afterwards is logged, and the user learns of it from the event log.
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
@@ -16,7 +15,7 @@
 #include <memory>
 
 #include "ground/ConfList.h"
-#include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "ground/RouterScript.h"
 #include "ground/TextFile.h"
 #include "programs/tavoportforward/Description.h"
@@ -164,8 +163,8 @@ std::string RouterWhy(const std::vector<Refusal>& rgRefusals) {
 }
 
 int Run() {
-    const tavo::Descriptor fdLock(open(kLock, O_RDWR | O_CREAT | O_CLOEXEC, tavo::kPrivateMode));
-    if (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX) != 0) {  // whoever holds it is bounded
+    const tavo::FileLock lock(kLock);
+    if (!lock.Wait([] { return true; })) {  // whoever holds it is bounded
         return NotTried("the lock " + std::string(kLock) + " cannot be taken");
     }
     KnownRouter router;

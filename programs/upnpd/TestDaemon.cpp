@@ -65,15 +65,9 @@ void Report(const char* szStep, const char* szWord) {
 }  // namespace
 
 bool TestDaemon::TakeLock() {
-    mFdLock.Reset(open(kLockFile, O_RDWR | O_CREAT | O_CLOEXEC, kPrivateMode));
+    mLock = FileLock(kLockFile);
     const auto fnLate = Until(Clock::now() + kLockWait);
-    while (mFdLock.Get() >= 0 && flock(mFdLock.Get(), LOCK_EX | LOCK_NB) != 0) {
-        if (fnLate() || IsSignalled()) {
-            return false;
-        }
-        poll(nullptr, 0, kPollMilliseconds);
-    }
-    return mFdLock.Get() >= 0;
+    return mLock.Wait([&] { return !fnLate() && !IsSignalled(); });
 }
 
 bool TestDaemon::OpenSocket() {

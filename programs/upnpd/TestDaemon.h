@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "programs/common/IgdRouter.h"
 #include "programs/common/SignalQueue.h"
 #include "programs/upnpd/TestMappings.h"
@@ -47,7 +48,7 @@ private:
     void WriteResults() const;
 
     SignalQueue mSignals;
-    Descriptor mFdLock;
+    FileLock mLock;
     Descriptor mFdOrders;
     std::vector<std::string> mRgszOrders;
     std::set<uint16_t> mSetRulePorts;  // what the rules ask for is not for tests

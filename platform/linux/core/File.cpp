@@ -2,7 +2,6 @@
 // Promises: outputs untouched on failure; other lines of a key file stay byte for byte; two processes
 // that set keys at once lose neither's.
 #include <fcntl.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -15,6 +14,7 @@
 #include "core/RunKeys.h"
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "ground/TextFile.h"
 #include "portforward/Aside.h"
 #include "tavo/core.h"
@@ -39,18 +39,15 @@ void CopyOut(const std::string& szText, char* szValue, int nSize) {
 // The directory's lock, for as long as a file in it is read, changed and replaced.
 class DirectoryLock {
 public:
-    explicit DirectoryLock(const std::string& szPath) {
-        mFd.Reset(open(tavo::DirectoryOf(szPath).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        // Held only for the moment of a replacement; a holder that hangs must not hang everybody.
-        for (int i = 0; i < kTries && flock(mFd.Get(), LOCK_EX | LOCK_NB) != 0 && errno == EWOULDBLOCK; ++i) {
-            usleep(kTryMicroseconds);
-        }
+    // Held only for the moment of a replacement. Anybody can lock a directory: a holder that hangs must not hang
+    // everybody, and what is to be written is written without the lock then.
+    explicit DirectoryLock(const std::string& szPath) : mLock(tavo::DirectoryOf(szPath), O_RDONLY | O_DIRECTORY) {
+        [[maybe_unused]] const bool blOurs = mLock.Wait([nLeft = kTries]() mutable { return --nLeft > 0; });
     }
 
 private:
-    static constexpr int kTries = 200;
-    static constexpr useconds_t kTryMicroseconds = 10000;
-    tavo::Descriptor mFd;
+    static constexpr int kTries = 100;
+    tavo::FileLock mLock;
 };
 
 std::string FormatKeyLine(const char* szFormat, const std::string& szKey, const std::string& szValue) {

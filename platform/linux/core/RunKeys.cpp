@@ -5,7 +5,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -17,6 +16,7 @@
 #include "ground/BootId.h"
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "ground/Paths.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
@@ -318,8 +318,8 @@ int TAVORunKeysMend() {
         if (!record || IsAlive(*record)) {
             return record ? 1 : 0;
         }
-        const Descriptor fdLock(open(kRouterLock, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-        if (IsRouterLockOurs() && (fdLock.Get() < 0 || flock(fdLock.Get(), LOCK_EX | LOCK_NB) != 0)) {
+        const tavo::FileLock lock(kRouterLock, O_RDWR | O_NOFOLLOW);
+        if (IsRouterLockOurs() && !lock.Try()) {
             return 1;
         }
         return MendLocked();

@@ -2,8 +2,6 @@
 // Promises: see Aside.h.
 #include "portforward/Aside.h"
 
-#include <fcntl.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -15,8 +13,8 @@
 #include <string_view>
 #include <vector>
 
-#include "ground/Descriptor.h"
 #include "ground/Directory.h"
+#include "ground/FileLock.h"
 #include "ground/Rename.h"
 #include "ground/Suffix.h"
 #include "ground/SysLog.h"
@@ -82,8 +80,7 @@ bool IsOlder(const timespec& one, const timespec& other) {
 // Whether the process lives that set the copy aside and wants it back itself: it holds it locked. Two who look at once
 // do not take each other for it.
 bool IsHeld(const AsideCopy& copy) {
-    const Descriptor fd(open(copy.szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-    return fd.Get() < 0 || flock(fd.Get(), LOCK_SH | LOCK_NB) != 0;
+    return !FileLock(copy.szPath, O_RDONLY).Try(LOCK_SH);
 }
 
 // Whether one copy has less to say than the other; what is half written has nothing.
