@@ -1,6 +1,7 @@
 // Reads and stores the settings of the router behind a gateway. Relies on the reader and writer of
 // router.conf, the two databases and the rule syntax of the port-forward tool.
 // Promises: arguments are checked before any work; a manual router's old settings come back after a failure.
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -109,6 +110,12 @@ bool IsReadFailure(int nErr) {
     return nErr == TLIBC_ERR_NO_MEMORY || nErr == TLIBC_ERR_OPEN || nErr == TLIBC_ERR_READ;
 }
 
+// A link that leads nowhere: there is something, and it is no file.
+bool IsDanglingLink(const char* szPath) {
+    struct stat status = {};
+    return lstat(szPath, &status) == 0 && S_ISLNK(status.st_mode) && stat(szPath, &status) != 0;
+}
+
 // Whether there are settings. The platform's reader brings back what a killed writer left, and waits for one of pages
 // that lives and has them aside for a moment: "nothing" must not be said before it has looked.
 bool IsStored() {
@@ -119,33 +126,53 @@ bool IsStored() {
     return pList != nullptr || TLIBCFileExist(kRouterConf) == 1;
 }
 
+// What a reader found; kUnlinked: what cannot be parsed, and is gone.
+enum class Look { kSection, kNothing, kFailed, kUnlinked };
+
+Look LookAt(RouterConfReader& reader) {
+    bool blExist = false;
+    if (reader.IsSectionExist(blExist) != 0) {
+        return blExist ? Look::kSection : Look::kNothing;
+    }
+    if (IsReadFailure(TLIBCErrGet())) {
+        return Look::kFailed;
+    }
+    if (TLIBCErrGet() == TLIBC_ERR_NOT_FOUND && !IsDanglingLink(kRouterConf)) {
+        // A writer has it aside, and may have put it back by now.
+        LogError("%s:%d file=%s not exists", kEntryFile, __LINE__, kRouterConf);
+        return Look::kNothing;
+    }
+    LogError("%s:%d file=%s has wrong format, try to unlink it", kEntryFile, __LINE__, kRouterConf);
+    return unlink(kRouterConf) == 0 ? Look::kUnlinked : Look::kNothing;
+}
+
+constexpr int kMostCopies = 8;  // that cannot be parsed either, before there are said to be none
+
 int FillRouterConf(const char* szGwRouterIP, RouterConf& conf) {
     if (!IsStored()) {
         LogError("%s:%d file=%s not exists", kEntryFile, __LINE__, kRouterConf);
         return kNothingStored;
     }
-    TLIBCErrSet(TLIBC_ERR_NONE, kEntryFile, __LINE__);
-    RouterConfReader reader{std::string(szGwRouterIP)};
-    bool blExist = false;
-    if (reader.IsSectionExist(blExist) == 0) {
-        if (IsReadFailure(TLIBCErrGet())) {
-            return -1;
+    // Settings that a killed writer left come back in the place of what cannot be parsed, and at once: not "nothing"
+    // first, and old settings at the next call.
+    for (int i = 0; i < kMostCopies && (i == 0 || IsStored()); ++i) {
+        TLIBCErrSet(TLIBC_ERR_NONE, kEntryFile, __LINE__);
+        RouterConfReader reader{std::string(szGwRouterIP)};
+        switch (LookAt(reader)) {
+            case Look::kSection:
+                return FillIdentity(reader, conf) &&
+                               (IsDaemonRouter(conf) ? FillMaxRule(conf) : FillAccount(reader, conf))
+                           ? 0
+                           : -1;
+            case Look::kFailed:
+                return -1;
+            case Look::kNothing:
+                return kNothingStored;
+            case Look::kUnlinked:
+                break;
         }
-        if (TLIBCErrGet() == TLIBC_ERR_NOT_FOUND) {  // a writer has it aside, and may have put it back by now
-            LogError("%s:%d file=%s not exists", kEntryFile, __LINE__, kRouterConf);
-            return kNothingStored;
-        }
-        LogError("%s:%d file=%s has wrong format, try to unlink it", kEntryFile, __LINE__, kRouterConf);
-        unlink(kRouterConf);
-        return kNothingStored;
     }
-    if (!blExist) {
-        return kNothingStored;
-    }
-    if (!FillIdentity(reader, conf)) {
-        return -1;
-    }
-    return (IsDaemonRouter(conf) ? FillMaxRule(conf) : FillAccount(reader, conf)) ? 0 : -1;
+    return kNothingStored;
 }
 
 // Storing goes through three outcomes: done, refused before anything was touched, or to be undone.
@@ -296,6 +323,10 @@ int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerCo
             return FinishStoring(StoreDaemonRouter(writer));
         }
         const tavo::lib::HeldFile held(kRouterConf);
+        if (!held.IsHeld()) {  // what is moved aside could come back while the new settings are tried
+            LogError("%s:%d can not save backup file of '%s'", kEntryFile, __LINE__, kRouterConfBak);
+            return -1;
+        }
         return FinishStoring(StoreManual(writer, szGwRouterIP, *routerConf, pErr));
     });
 }

@@ -80,7 +80,8 @@ public:
             const tavo::lib::ConfList pList(TAVOPFGwRouterConfGet());
         }
         mSettings.emplace(kRouterConf);
-        if (TLIBCFileExist(kRouterConf) != 1 || rename(kRouterConf, mSzAside.c_str()) == 0) {
+        // What cannot be held could be brought back too soon, and be packed with the password in it.
+        if (TLIBCFileExist(kRouterConf) != 1 || (mSettings->IsHeld() && rename(kRouterConf, mSzAside.c_str()) == 0)) {
             return true;
         }
         LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());

@@ -16,6 +16,7 @@
 #include <cstdarg>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 #include <utility>
 
 #include "Tool.h"
@@ -37,7 +38,9 @@ constexpr size_t kVersionSize = 1024;
 constexpr size_t kPathSize = 4096;
 constexpr size_t kToolLineSize = 1024;
 constexpr size_t kSuffixSize = 6;
-constexpr int kNameTries = 5000;  // one name in sixty is taken, at the worst
+constexpr int kNameTries = 100;
+constexpr int kHoldTries = 100;
+constexpr useconds_t kHoldMicroseconds = 20000;
 constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
 constexpr std::string_view kVersionKey = "syntax version";
 
@@ -88,25 +91,31 @@ void RenameLogged(const char* szFrom, const char* szTo, int nLine) {
     }
 }
 
-enum class Kind { kSmall, kCapital, kDigit, kOther };
-
-Kind KindOf(char c) {
-    return c >= 'a' && c <= 'z'   ? Kind::kSmall
-           : c >= 'A' && c <= 'Z' ? Kind::kCapital
-           : c >= '0' && c <= '9' ? Kind::kDigit
-                                  : Kind::kOther;
-}
-
-// Whether the end of the name is none that a person gives to a copy: among its six characters no two neighbours
-// are of one kind. By that, and by a digit at the beginning, the platform knows what a killed process left.
-bool IsUnmistakable(std::string_view szName, bool blDigitFirst) {
-    if (szName.size() < kSuffixSize) {
-        return false;
+// The end of a name as no person gives it to a copy: small letters, capitals and digits, no two neighbours of one kind,
+// and the last one follows from the others. By that, and by a digit at the beginning, the platform knows what a killed
+// process left.
+std::string Unmistakable(std::string_view szRandom, bool blDigitFirst) {
+    constexpr std::string_view kKinds[] = {"0123456789", "abcdefghijklmnopqrstuvwxyz", "ABCDEFGHIJKLMNOPQRSTUVWXYZ"};
+    constexpr size_t kThree = std::size(kKinds);
+    std::string szEnd;
+    size_t nKind = 0;
+    size_t nBefore = 0;
+    size_t nSum = 5;
+    for (size_t i = 0; i < szRandom.size(); ++i) {
+        const auto nRandom = static_cast<unsigned char>(szRandom[i]);
+        size_t nNext = (nKind + 1 + nRandom % 2) % kThree;
+        if (i == 0) {
+            nNext = blDigitFirst ? 0 : 1 + nRandom % 2;
+        } else if (i == 2) {
+            nNext = kThree - nKind - nBefore;  // the one that is missing yet
+        }
+        nBefore = nKind;
+        nKind = nNext;
+        const size_t nPlace = (i + 1 < szRandom.size() ? nRandom / 2 : nSum) % kKinds[nKind].size();
+        szEnd += kKinds[nKind][nPlace];
+        nSum += nPlace;
     }
-    const std::string_view szSuffix = szName.substr(szName.size() - kSuffixSize);
-    return (KindOf(szSuffix.front()) == Kind::kDigit) == blDigitFirst &&
-           std::adjacent_find(szSuffix.begin(), szSuffix.end(),
-                              [](char c, char d) { return KindOf(c) == KindOf(d); }) == szSuffix.end();
+    return szEnd;
 }
 
 struct RecordFields {
@@ -281,17 +290,31 @@ void FlushDirectoryOf(const char* szPath) {
     }
 }
 
+// A reader, or another program, may have it locked for a moment.
 HeldFile::HeldFile(const char* szPath) {
-    if (TLIBCFileExist(szPath) == 1) {
+    for (int i = 0; i < kHoldTries && !mBlHeld; ++i) {
+        if (i > 0) {
+            usleep(kHoldMicroseconds);
+        }
+        Release();
+        struct stat there = {};
+        if (TLIBCFileExist(szPath) != 1 || stat(szPath, &there) != 0) {
+            mBlHeld = true;
+            return;
+        }
+        // What stands there by now may be another file than the one that was opened.
+        struct stat own = {};
         mFd = open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-        flock(mFd, LOCK_EX | LOCK_NB);
+        mBlHeld = mFd >= 0 && flock(mFd, LOCK_EX | LOCK_NB) == 0 && fstat(mFd, &own) == 0 &&
+                  stat(szPath, &there) == 0 && own.st_ino == there.st_ino && own.st_dev == there.st_dev;
     }
 }
 
-HeldFile::~HeldFile() {
+void HeldFile::Release() {
     if (mFd >= 0) {
         close(mFd);
     }
+    mFd = -1;
 }
 
 bool IsGatewayAddress(const char* szGwRouterIP) {
@@ -399,15 +422,17 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
 }
 
 std::string UniqueName(const char* szPath, AsideFor enFor) {
-    const std::string szTemplate = std::string(szPath) + "XXXXXX";
     std::string szName;
-    for (int i = 0; i < kNameTries && !IsUnmistakable(szName, enFor == AsideFor::kReport); ++i) {
-        szName = szTemplate;
+    struct stat status = {};
+    for (int i = 0; i < kNameTries && (szName.empty() || lstat(szName.c_str(), &status) == 0); ++i) {
+        std::string szRandom = std::string(szPath) + "XXXXXX";
         // The name is only ever renamed to, never opened, and its directory is root's own.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
-        mktemp(szName.data());
+        mktemp(szRandom.data());
 #pragma GCC diagnostic pop
+        szRandom.erase(0, szRandom.size() - kSuffixSize);
+        szName = szPath + Unmistakable(szRandom, enFor == AsideFor::kReport);
     }
     return szName;
 }

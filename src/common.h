@@ -126,16 +126,23 @@ private:
 void FlushDirectoryOf(const char* szPath);
 
 // Holds the file at szPath locked, under whatever name it gets meanwhile, as long as the object and the process live:
-// readers bring back what a killed writer set aside, and leave alone what is held.
+// readers bring back what a killed writer set aside, and leave alone what is held. Waits two seconds for it at most.
 class HeldFile {
 public:
     explicit HeldFile(const char* szPath);
-    ~HeldFile();
+    ~HeldFile() { Release(); }
     HeldFile(const HeldFile&) = delete;
     HeldFile& operator=(const HeldFile&) = delete;
 
+    // False: somebody else has it locked, and readers could not tell it from what a killed writer left. Where there is
+    // no file, there is nothing to hold.
+    bool IsHeld() const { return mBlHeld; }
+
 private:
+    void Release();
+
     int mFd = -1;
+    bool mBlHeld = false;
 };
 
 // Whether a caller's gateway argument is an IP address; a refusal is logged.
@@ -193,9 +200,9 @@ bool FillText(char (&szField)[N], const std::string& szText) {
 ConfList NewSection(const std::string& szName, const char* szNoNode, const char* szNoHash, const char* szFile,
                     int nLine);
 
-// A name beside szPath that nothing has yet: szPath and six letters and digits, of which no two neighbours are of one
-// kind (small letter, capital, digit). The platform brings back what a killed writer left under such a name: for one
-// that writes the file anew where it is missing, for a report (whose name has a digit first) whatever is there.
+// A name beside szPath that nothing has yet: szPath and six letters and digits as nobody chooses them. The platform
+// brings back what a killed writer left under such a name: for one that writes the file anew where it is missing, for a
+// report (whose name has a digit first) whatever is there.
 enum class AsideFor { kWriting, kReport };
 std::string UniqueName(const char* szPath, AsideFor enFor);
 

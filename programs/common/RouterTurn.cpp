@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "ground/SysLog.h"
+
 namespace tavo {
 
 namespace {

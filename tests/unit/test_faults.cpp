@@ -10,9 +10,11 @@
 #include <algorithm>
 #include <functional>
 #include <memory>
+#include <thread>
 
 #include "InitState.h"
 #include "ground/Descriptor.h"
+#include "ground/FileLock.h"
 #include "libtavoportmap.h"
 #include "stage.h"
 #include "tavo/core.h"
@@ -193,13 +195,14 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
         const char* szName;
         int nOlder;
         bool blGoes;
-    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zz", 1, true},    {"rule.confN3wEr1", -60, false},
+    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zc", 1, true},    {"rule.conf1a2b3c", 60, false},
+                    {"rule.confaB3dE7", 60, false}, {"rule.confv1B2c3", 60, false},  {"rule.confN3wEr4", -60, false},
                     {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false},  {"rule.confNov25a", 60, false},
                     {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false}, {"rule.confbackup", 60, false},
                     {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},  {"rule.confaB3dE", 60, false},
                     {"rule.confaB3dE67", 60, false}};
     Write(kRuleConf, kOldRules);
-    symlink("/etc/portforward/rule.conf.saved", "/etc/portforward/rule.confaBcDe0");
+    symlink("/etc/portforward/rule.conf.saved", "/etc/portforward/rule.confaBcDe5");
     for (const auto& copy : rgCopies) {
         const std::string szPath = std::string(kDir) + "/" + copy.szName;
         Write(szPath, std::string("[") + copy.szName + "]\nenabled=1\n");
@@ -214,13 +217,13 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
     for (const auto& copy : rgCopies) {
         EXPECT_EQ(std::filesystem::exists(std::string(kDir) + "/" + copy.szName), !copy.blGoes) << copy.szName;
     }
-    EXPECT_TRUE(std::filesystem::is_symlink("/etc/portforward/rule.confaBcDe0"));
+    EXPECT_TRUE(std::filesystem::is_symlink("/etc/portforward/rule.confaBcDe5"));
     EXPECT_EQ(Read(kRuleConf), kOldRules);
 
     // What a person could have named is not taken for the rules, either.
     std::filesystem::remove(kRuleConf);
     EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 1);
-    EXPECT_EQ(Read(kRuleConf), "[rule.confN3wEr1]\nenabled=1\n");
+    EXPECT_EQ(Read(kRuleConf), "[rule.confN3wEr4]\nenabled=1\n");
 }
 
 using RouterConf = __tag_TAVO_ROUTER_CONF;
@@ -358,6 +361,87 @@ TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
     ASSERT_EQ(flock(fdForeign.Get(), LOCK_SH), 0);
     CallAndDie({"", "no", 0, false});
     EXPECT_EQ(Read(kRouterConf), kOldSettings);
+}
+
+// What a report sets aside is held, or not set aside: with a lock of somebody else's on it, a reader would take the
+// report for dead, and the user's own file would be packed.
+TEST_F(Faults, AReportPacksNoPasswordWhoeverHasTheSettingsLocked) {
+    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
+    Write(kRouterConf, kOldSettings);
+    tavo::FileLock foreign(kRouterConf, O_RDONLY);
+    ASSERT_TRUE(foreign.Try(LOCK_SH));
+    const KilledCall report{"", nullptr, 1, false};
+    CallAndDie(report);
+    EXPECT_FALSE(
+        std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); }));
+    EXPECT_EQ(Read(kRouterConf), kOldSettings);
+    EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"}));
+    std::thread release([&] {
+        usleep(100000);
+        foreign.Release();
+    });
+    CallAndDie(report);  // a look that locks for a moment is waited for
+    release.join();
+    EXPECT_TRUE(
+        std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); }));
+    EXPECT_EQ(Read(kRouterConf), kOldSettings);
+}
+
+TEST_F(Faults, WhatAReportSetAsideComesBackUnlessSomebodyHasWrittenSince) {
+    const std::string szHand = "[192.168.1.1]\nbrand=Hand\nsupport_router_upnp=no\nsupport_router_natpmp=no\n";
+    const struct {
+        const char* szCopy;
+        int nLater;  // seconds from then to what stands in the settings' place now
+        const char* szBrand;
+        bool blGoes;  // the copy, an hour later
+    } rgCases[] = {{"3aB4cP", 0, "Old", true},
+                   {"3aB4cP", 60, "Hand", true},
+                   {"1a2b3c", 0, "Hand", false},
+                   {"3aB4cD", 0, "Hand", false}};
+    for (const auto& one : rgCases) {
+        SetUp();
+        const std::string szCopy = kRouterConf + std::string(one.szCopy);
+        Write(szCopy, kOldSettings);
+        Write(kRouterConf, szHand);
+        std::filesystem::last_write_time(kRouterConf,
+                                         std::filesystem::last_write_time(szCopy) + std::chrono::seconds(one.nLater));
+        for (const time_t nAhead : {0, 3600, 7200}) {
+            gNClockAhead = nAhead;
+            const auto pConf = std::make_unique<RouterConf>();
+            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), 0);
+            EXPECT_STREQ(pConf->szBrand, one.szBrand) << one.szCopy << " " << one.nLater;
+        }
+        gNClockAhead = 0;
+        EXPECT_EQ(std::filesystem::exists(szCopy), !one.blGoes) << one.szCopy << " " << one.nLater;
+        EXPECT_EQ(std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.find("killed") + 1 != 0; }),
+                  one.blGoes);
+    }
+}
+
+// The same answer at the first call and at the second, whatever stands there.
+TEST_F(Faults, SettingsThatCannotBeReadMakeRoomForThoseOfBefore) {
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnMake;
+        bool blCopy;
+    } rgCases[] = {{"garbage", [] { Write(kRouterConf, "garbage\n"); }, false},
+                   {"garbage and a copy", [] { Write(kRouterConf, "garbage\n"); }, true},
+                   {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }, false},
+                   {"a link to nowhere and a copy", [] { symlink("/nowhere", kRouterConf); }, true}};
+    for (const auto& one : rgCases) {
+        SetUp();
+        one.fnMake();
+        if (one.blCopy) {
+            Write(std::string(kRouterConf) + ".bak", kOldSettings);
+        }
+        for (int i = 0; i < 2; ++i) {
+            const auto pConf = std::make_unique<RouterConf>();
+            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), one.blCopy ? 0 : 1) << one.szWhat;
+            EXPECT_EQ(Read(kRouterConf), one.blCopy ? kOldSettings : "") << one.szWhat;
+            EXPECT_EQ(Names(), one.blCopy ? Lines{"router.conf"} : Lines()) << one.szWhat;
+        }
+        EXPECT_TRUE(Logged("file=/etc/portforward/router.conf has wrong format, try to unlink it"));
+    }
 }
 
 TEST_F(Faults, ReadersNeverSeeNoSettingsWhileSomebodyWrites) {

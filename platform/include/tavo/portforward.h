@@ -38,12 +38,14 @@ void TAVOPFConfFree(TAVO_PF_CONF* pHead);
  * one, or one that cannot be parsed, has a section name that does not fit or more than 16384 sections
  * (the last error tells them apart: TLIBC_ERR_NONE for empty, TLIBC_ERR_NOT_FOUND for no file).
  * Blank lines and comments alone are an empty file, and are taken out of it.
- * A writer moves the old file aside, to its name and six more letters and digits of which no two neighbours
- * are of one kind (small letter, capital, digit), before it writes the new one. Where it was killed in between,
+ * A writer moves the old file aside, to its name and six more letters and digits (small letters, capitals and
+ * digits; no two neighbours of one kind; the last one is the five's places in their kinds, summed up, plus five,
+ * counted round in its own kind), before it writes the new one. Where it was killed in between,
  * the newest such copy is put back before the file is read; copies that later writes made obsolete are deleted
  * once they are ten minutes old. Any other name is a person's own copy, and left alone, but for router.conf.bak,
  * which comes back like the others. A copy of router.conf whose six begin with a digit is what a report set
- * aside: once the report is gone it comes back whatever is there. Who sets a copy aside for longer and wants it
+ * aside: once the report is gone it comes back in the place of what the report put there, unless that was changed by
+ * hand more than ten seconds later. Who sets a copy aside for longer and wants it
  * back himself holds it locked (flock): it is left to him as long as he lives. */
 TAVO_PF_CONF* TAVOPFRuleGet(void);
 TAVO_PF_CONF* TAVOPFTestRuleGet(void);

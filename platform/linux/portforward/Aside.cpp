@@ -26,6 +26,7 @@ namespace {
 constexpr std::string_view kRouterName = "router.conf";
 constexpr std::string_view kRouterConf = "/etc/portforward/router.conf";
 constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
+constexpr time_t kStandInSeconds = 10;    // within which a report has put its own settings in the place of the user's
 
 enum class Kind {
     kNone,      // none of ours
@@ -89,20 +90,28 @@ bool IsWorse(const AsideCopy& one, const AsideCopy& other) {
     return blHalf != (other.enKind == Kind::kNew) ? blHalf : IsOlder(one.status.st_mtim, other.status.st_mtim);
 }
 
-// What a report that was killed has set aside takes its place again, whatever the report has put there. Were there
+// Whether what is live now was written after a report had put its own settings there: by a person, by hand.
+bool IsNewer(const struct stat& live, const AsideCopy& copy) {
+    return copy.enKind == Kind::kReported && live.st_mtim.tv_sec > copy.status.st_ctim.tv_sec + kStandInSeconds;
+}
+
+// What a report that was killed has set aside takes the place again of what the report has put there. Were there
 // two, the later one would be what the earlier report had made.
 void BringBackReported(const char* szPath, const std::vector<AsideCopy>& rgCopies) {
+    struct stat live = {};
+    const bool blLive = lstat(szPath, &live) == 0;
     std::vector<AsideCopy> rgReported;
-    std::copy_if(rgCopies.begin(), rgCopies.end(), std::back_inserter(rgReported),
-                 [](const AsideCopy& copy) { return copy.enKind == Kind::kReported && !IsHeld(copy); });
+    std::copy_if(rgCopies.begin(), rgCopies.end(), std::back_inserter(rgReported), [&](const AsideCopy& copy) {
+        return copy.enKind == Kind::kReported && !(blLive && IsNewer(live, copy)) && !IsHeld(copy);
+    });
     std::sort(rgReported.begin(), rgReported.end(), [](const AsideCopy& one, const AsideCopy& other) {
         return IsOlder(one.status.st_ctim, other.status.st_ctim);
     });
     bool blBack = false;
     for (const AsideCopy& copy : rgReported) {
-        if (blBack) {
-            unlink(copy.szPath.c_str());
-        } else if (rename(copy.szPath.c_str(), szPath) == 0) {
+        if (blBack && unlink(copy.szPath.c_str()) == 0) {
+            SysLog(LOG_WARNING, "%s, which another killed report set aside later, is deleted", copy.szPath.c_str());
+        } else if (!blBack && rename(copy.szPath.c_str(), szPath) == 0) {
             blBack = true;
             SysLog(LOG_WARNING, "a report was killed; the settings that it had set aside as %s are %s again",
                    copy.szPath.c_str(), szPath);
@@ -160,7 +169,8 @@ void DropObsolete(const char* szPath) {
         struct stat link = {};
         const bool blPlain = lstat(copy.szPath.c_str(), &link) == 0 && S_ISREG(link.st_mode);
         const bool blObsolete = copy.enKind == Kind::kNew || IsOlder(copy.status.st_mtim, live.st_mtim);
-        const bool blWriters = copy.enKind == Kind::kNew || copy.enKind == Kind::kAside;
+        const bool blWriters =
+            copy.enKind == Kind::kNew || copy.enKind == Kind::kAside || (IsNewer(live, copy) && !IsHeld(copy));
         if (blPlain && blWriters && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
             unlink(copy.szPath.c_str()) == 0) {
             SysLog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
