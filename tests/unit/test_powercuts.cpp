@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mount.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -527,6 +528,54 @@ TEST_F(PowerCuts, ASaveThatIsCutOffLeavesTheDaemonOn) {
         EXPECT_TRUE(SavedRule() == "80" || (nMarks == 0 && SavedRule() == "1")) << SavedRule();
     });
     EXPECT_GT(nStates, 10);
+}
+
+// Whoever writes the file of the keys between a killed save and its mending: his keys stand, if he wrote them.
+TEST_F(PowerCuts, WhatOthersWriteBesideTheKeysIsKeptAndTheKeysComeBack) {
+    const auto fnReplace = [](const std::string& szOld, const std::string& szNew) {
+        std::string szText = Read(kSystemConf);
+        const size_t nAt = szText.find(szOld);
+        ASSERT_NE(nAt, std::string::npos) << szText;
+        std::filesystem::remove(kSystemConf);
+        Write(kSystemConf, szText.replace(nAt, szOld.size(), szNew));
+    };
+    const auto fnSet = [](const char* szKey, const char* szValue) {
+        EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, szKey, szValue, nullptr), 1);
+    };
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnWrite;
+        const char* szKeys;
+    } rgCases[] = {{"nobody", [] {}, "hyesno"},
+                   {"another key", [&] { fnSet("hand", "g"); }, "gyesno"},
+                   {"another key, by an editor", [&] { fnReplace("hand=\"h\"", "hand=\"g\""); }, "gyesno"},
+                   {"a new key", [&] { fnSet("more", "m"); }, "hyesno"},
+                   {"the same, word for word", [&] { fnReplace("hand", "hand"); }, "hnono"},
+                   {"the key itself", [&] { fnSet("runupnpportmapping", "no"); }, "hnono"},
+                   {"the other daemon and another key",
+                    [&] {
+                        fnSet("runnatpmpportmapping", "yes");
+                        fnSet("hand", "g");
+                    },
+                    "gnoyes"}};
+    SetSettings("yes");
+    for (const auto& one : rgCases) {
+        std::filesystem::remove_all("/var/lib/tavo");
+        Write(kSystemConf, "hand=\"h\"\nrunupnpportmapping=\"yes\"\nrunnatpmpportmapping=\"no\"\n");
+        const pid_t pid = fork();
+        if (pid == 0) {
+            const bool blBegun = TAVORunKeysRemember() == 0 &&
+                                 TLIBCFileSetKeyValue(kSystemConf, "runupnpportmapping", "no", nullptr) == 1;
+            _exit(blBegun ? 0 : 1);
+        }
+        int nStatus = 1;
+        ASSERT_EQ(waitpid(pid, &nStatus, 0), pid);
+        ASSERT_EQ(nStatus, 0);
+        ASSERT_EQ(Keys(), "hnono");
+        one.fnWrite();
+        EXPECT_EQ(TAVORunKeysMend(), 0) << one.szWhat;
+        EXPECT_EQ(Keys(), one.szKeys) << one.szWhat;
+    }
 }
 
 }  // namespace

@@ -6,7 +6,8 @@
  * the next start of a daemon takes every port away. Whoever starts such an operation therefore notes the
  * keys in /var/lib/tavo/run_keys.conf first, with its own process and the state of rule.conf and
  * router.conf. What it then does to the keys through TLIBCFileSetKeyValue() is noted there as its own; keys
- * that anybody else writes afterwards stand. A record that is no plain file of root's, or that holds anything
+ * that anybody else writes afterwards stand; who has changed something else in the file, and left both off, has not
+ * written them. A record that is no plain file of root's, or that holds anything
  * else, is as good as none.
  */
 #ifndef TAVO_RUNKEYS_H

@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -59,10 +60,16 @@ struct Record {
     Keys keys;
     std::string szRules, szRouter;  // the two files
     std::string szSystem;           // the file of the keys as the process left it, and as it was about to
+    std::string szRest = {};        // what else stands in that file, from the process's first write on
 
     std::string Owner() const { return szPid + " " + szStart + " " + szBoot; }
     bool Left(const std::string& szIdentity) const {
         return (" " + szSystem + " ").find(" " + szIdentity + " ") != std::string::npos;
+    }
+    // Whether the file was written since by somebody who was at something else in it, and left alone that the process
+    // had switched the daemons off.
+    bool LeftIn(const std::string& szRestNow, const Keys& keysNow) const {
+        return !szRest.empty() && szRest != szRestNow && keysNow == Keys();
     }
 };
 
@@ -107,6 +114,21 @@ std::string IdentityOf(const char* szPath) {
     return stat(szPath, &status) == 0 ? IdentityOf(status) : errno == ENOENT ? "absent" : "unknown";
 }
 
+// Another text for other lines beside those of the run keys.
+std::string RestOf(std::string_view szText) {
+    uint64_t nHash = 0xcbf29ce484222325U;  // FNV-1a: whoever could mean harm by it can write the keys themselves
+    for (const std::string_view szLine : tavo::SplitLines(szText)) {
+        const auto pair = tavo::ParseKeyLine(szLine);
+        if (pair && (pair->szKey == kNatpmp.szKey || pair->szKey == kUpnp.szKey)) {
+            continue;
+        }
+        for (const char c : std::string(szLine) + "\n") {
+            nHash = (nHash ^ static_cast<unsigned char>(c)) * 0x100000001b3U;
+        }
+    }
+    return std::to_string(nHash);
+}
+
 bool IsOn(const Daemon& daemon) {
     char szValue[8] = {};
     return TLIBCFileGetKeyValue(kSystemConf, daemon.szKey, szValue, sizeof(szValue), 0) >= 1 &&
@@ -130,15 +152,19 @@ Record Now() {
 // ---- the record --------------------------------------------------------------------------------------------
 
 std::string ToText(const Record& record) {
-    return tavo::FormatSections({{"keys",
-                                  {{"pid", record.szPid},
-                                   {"start", record.szStart},
-                                   {"boot", record.szBoot},
-                                   {"natpmp", record.keys.blNatpmp ? "yes" : "no"},
-                                   {"upnp", record.keys.blUpnp ? "yes" : "no"},
-                                   {"rules", record.szRules},
-                                   {"router", record.szRouter},
-                                   {"system", record.szSystem}}}});
+    tavo::Section section{"keys",
+                          {{"pid", record.szPid},
+                           {"start", record.szStart},
+                           {"boot", record.szBoot},
+                           {"natpmp", record.keys.blNatpmp ? "yes" : "no"},
+                           {"upnp", record.keys.blUpnp ? "yes" : "no"},
+                           {"rules", record.szRules},
+                           {"router", record.szRouter},
+                           {"system", record.szSystem}}};
+    if (!record.szRest.empty()) {
+        section.rgPairs.push_back({"rest", record.szRest});
+    }
+    return tavo::FormatSections({section});
 }
 
 // The text of a record file that is root's alone; nothing for any other.
@@ -170,8 +196,8 @@ std::optional<Record> ReadRecord() {
         return it == rgPairs.end() ? std::string() : it->szValue;
     };
     const Record record{
-        fnGet("pid"),   fnGet("start"),  fnGet("boot"),  {fnGet("natpmp") == "yes", fnGet("upnp") == "yes"},
-        fnGet("rules"), fnGet("router"), fnGet("system")};
+        fnGet("pid"),   fnGet("start"),  fnGet("boot"),   {fnGet("natpmp") == "yes", fnGet("upnp") == "yes"},
+        fnGet("rules"), fnGet("router"), fnGet("system"), fnGet("rest")};
     // What it does not say word for word as it is written, it does not say.
     const bool blWhole = IsNumber(record.szPid) && IsNumber(record.szStart) && ToText(record) == *szText;
     return blWhole ? std::optional(record) : std::nullopt;
@@ -204,7 +230,8 @@ Keys KeysBySettings() {
 
 // What the keys should be, by what has become of the files since the record was made.
 Keys Wanted(const Record& record, const Record& now) {
-    if (record.szRouter != now.szRouter || !record.Left(now.szSystem)) {
+    const std::string szRest = RestOf(ReadFile(kSystemConf).value_or(""));
+    if (record.szRouter != now.szRouter || (!record.Left(now.szSystem) && !record.LeftIn(szRest, now.keys))) {
         // Another router, or another way to drive it, of which the next save switches on what it needs; or somebody
         // else has written the keys, and knows what he wants.
         return now.keys;
@@ -275,6 +302,7 @@ bool tavo::NoteWrite(std::string_view szPath, int fdNew) {
     const std::string szNow = IdentityOf(kSystemConf);
     const std::string szBefore = record->Left(szNow) ? szNow + " " : "";
     record->szSystem = fstat(fdNew, &status) == 0 ? szBefore + IdentityOf(status) : szBefore;
+    record->szRest = RestOf(ReadFile("/proc/self/fd/" + std::to_string(fdNew)).value_or(""));
     return WriteFileAtomic(kRecord, ToText(*record));
 }
 
