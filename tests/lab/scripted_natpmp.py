@@ -33,8 +33,9 @@ def answer(opcode, port, external, lifetime):
         return head(0) + socket.inet_aton("198.41.0.4")
     if FAULT in ("version", "garbage"):
         return head(opcode) + struct.pack("!HHI", port, external, lifetime)
-    if FAULT == "refuse":
-        return head(opcode, CODE) + (struct.pack("!HHI", port, 0, 0) if CODE != 2 else b"")
+    if FAULT == "refuse" or (FAULT == "short_lease" and port == 5002):
+        code = CODE if FAULT == "refuse" else 4
+        return head(opcode, code) + (struct.pack("!HHI", port, 0, 0) if code != 2 else b"")
     name = f"{'udp' if opcode == 1 else 'tcp'} {port}"
     if lifetime == 0:
         if FAULT == "will_not_close":
