@@ -1221,6 +1221,8 @@ class Tool(unittest.TestCase):
 
 
 if __name__ == "__main__":
+    for number in (signal.SIGHUP, signal.SIGINT, signal.SIGTERM):  # whoever starts this may ignore them
+        signal.signal(number, signal.default_int_handler if number == signal.SIGINT else signal.SIG_DFL)
     os.makedirs(CONF, exist_ok=True)
     for step in ("link add box type veth peer name router", "addr add 192.168.77.2/24 dev box", "link set box up",
                  "link set router up", f"route add default via {GATEWAY}"):

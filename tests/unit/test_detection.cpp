@@ -131,7 +131,7 @@ TEST_F(Detection, UpnpVerdicts) {
         {"path out of the database", 0, TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}, true, "yes", "", 1,
          "pfPath does not exist"},
     };
-    Write("/etc.defaults/portforward/etc/x/router.des", "");
+    Write("/etc.defaults/etc/x/router.des", "");
     for (const UpnpCase& upnpCase : rgCases) {
         SCOPED_TRACE(upnpCase.szWhat);
         mNetwork = Network();

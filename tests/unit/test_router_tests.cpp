@@ -277,6 +277,7 @@ TEST_F(RouterTests, RecordIsTheOnlyOne) {
     int nMax = 0;
     EXPECT_TRUE(RouterUpnpDB("a\"]\n[b", "", "").GetMaxRule(nMax));
     EXPECT_EQ(nMax, 32);
+    EXPECT_EQ(Read("/etc/portforward/router_upnp.db.user").find("[//]"), std::string::npos) << "the last one went";
 }
 
 void SetDetected(const char* szBrand) {

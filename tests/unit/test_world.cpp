@@ -23,6 +23,7 @@ int gNSlept = 0;
 std::function<void()> gFnOnSleep;
 std::function<int()> gFnOnConfSet;
 int gNClockStep = 0;
+time_t gNClockJumped = 0;
 long gNGoodAllocations = -1;
 bool gBlOneFailure = false;
 bool gBlAllocationFailed = false;
@@ -107,9 +108,8 @@ unsigned sleep(unsigned nSeconds) {
 
 int clock_gettime(clockid_t nClock, timespec* pTime) {
     static const auto fnReal = reinterpret_cast<int (*)(clockid_t, timespec*)>(dlsym(RTLD_NEXT, "clock_gettime"));
-    static time_t nAhead = 0;
     const int nResult = fnReal(nClock, pTime);
-    pTime->tv_sec += nAhead += gNClockStep;
+    pTime->tv_sec += gNClockJumped += gNClockStep;
     return nResult;
 }
 

@@ -39,6 +39,7 @@ extern std::function<int()> gFnOnConfSet;
 extern time_t gNClockAhead;
 // Seconds that the clock jumps ahead each time somebody looks at it.
 extern int gNClockStep;
+extern time_t gNClockJumped;  // in all; a timer of the kernel does not know of it
 
 // Memory runs out after so many allocations (never: negative), for one of them or for good.
 extern long gNGoodAllocations;
