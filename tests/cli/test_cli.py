@@ -768,7 +768,9 @@ class Tool(unittest.TestCase):
                               stdin=subprocess.PIPE) as daemon:  # waits for a program to run
             self.expect("compat", BUSY, "running already", LD_PRELOAD=STAND_IN, TAVO_COMPAT="0 0 Zeta yes 9 10")
             self.assertIsNone(daemon.poll())
+            begin = time.monotonic()
             self.expect("compat --stop", OK, "the test is stopped")
+            self.assertLess(time.monotonic() - begin, 5, "it waits for the end of the test, and no longer")
             self.assertEqual(daemon.wait(timeout=10), -signal.SIGHUP)
 
     def test_reachability_is_told_port_by_port_and_never_guessed(self):
@@ -932,6 +934,35 @@ class Tool(unittest.TestCase):
         tool("rules", "discard")
         put(RULES, "")
         self.expect("status", OK, "no rules are in force")
+
+    def test_the_man_page_names_each_member_of_the_status(self):
+        self.publish(self.keep(), (443, "tcp", {"holder": {"address": "192.168.77.7", "description": "x"}}),
+                     left_over=[{"name": "8080/tcp", "address": "192.168.77.9", "why": "x", "until": None}])
+        tool("rules", "add", "new", "--router-port", "81")
+        told = self.json("status", LD_PRELOAD=STAND_IN, TAVO_LAST="1 Acme")[1]
+        page = get(f"{SOURCE}/docs/tavoportmap.1").replace("\\-", "-")
+        page = page[page.index("the members are always there"):page.index(".SH EXIT STATUS")]
+        heads = {word for line in re.findall(r"(?m)^\.TP\n(.*)", page) for word in re.findall(r"[a-z_0-9]{2,}", line)}
+        self.assertEqual(told.keys() - {"ok", "message", "warnings"}, heads)
+        words = {word for line in re.findall(r"(?m)^\.(?:B|BR|RB|IR) (.*)", page) for word in re.findall(r"[a-z_0-9]+", line)}
+        for part in ("settings", "last_detection", "outside", "upnpd", "last_look"):
+            self.assertLessEqual(told[part].keys(), words, part)
+        port = told["rules"][0]["ports"][0]
+        self.assertLessEqual({"state", "ports", *port, *port["holder"], *told["left_over"][0]}, words)
+
+    def test_without_a_gateway_nothing_is_done_and_that_is_said(self):
+        self.store((1, "tcp", "443", "8443", "web"))
+        tool("rules", "add", "new", "--router-port", "81")
+        before = get(RULES)
+        subprocess.run(["ip", "route", "del", "default"], check=True)
+        self.addCleanup(lambda: subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True))
+        for code, commands in ((AWAY, ("close 443", "off", "save", "status")),
+                               (FAILED, ("setup", "detect", "open 80", "save --dry-run", "router set --upnp yes", "router show",
+                                         "router table", "compat --yes", "report", "service set hoplink 80/tcp", "service detect"))):
+            for command in commands:
+                self.expect(command, code, "no default gateway", **WRITES)
+        self.assertEqual((get(RULES), os.path.exists(ROUTER), os.path.exists(OFF)), (before, False, False))
+        self.assertEqual([row[3] for row in self.rows()], ["443", "81"], "the edit still waits")
 
     def test_status_of_a_router_that_is_driven_through_its_pages(self):
         self.keep(on="none", alive=False)

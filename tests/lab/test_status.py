@@ -1,10 +1,11 @@
 """What "tavoportmap status" says of a real router and of what changes around it."""
 import json
+import re
 import signal
 import unittest
 
 import homelab
-from homelab import BUILD, LAN2, PUBLIC, wait_for
+from homelab import BUILD, HERE, LAN2, PUBLIC, wait_for
 
 LAB = None
 TOOL = f"{BUILD}/cli/tavoportmap"
@@ -41,6 +42,11 @@ class Status(unittest.TestCase):
             self.assertEqual([rule["state"] for rule in told["rules"]], ["refused", "open"])
             self.assertEqual(told["rules"][0]["ports"][0]["holder"], {"address": LAN2, "description": "libminiupnpc"})
         self.assertTrue(LAB.reaches("udp", 6001))
+        published = json.loads(LAB.read("/run/tavo/upnpd.json"))
+        rows = re.findall(r"(?m)^\| (`.*?) \| (.*) \|$", LAB.read(f"{HERE}/../../docs/file-formats.md").split("`/run/tavo/upnpd.json`")[1].split("What is not")[0])
+        self.assertEqual(published.keys(), {name for names, _ in rows for name in re.findall(r"`(\w+)`", names)})
+        of_rules = set(re.findall(r"`(\w+)`", dict(rows)["`rules`"]))
+        self.assertLessEqual({*published["rules"][0], *published["rules"][0]["holder"]}, of_rules)
         self.assertEqual((told["outside"], told["kept_by"]), ({"address": PUBLIC, "kind": "public"}, "upnpd"))
         table = LAB.run("box", f"{TOOL} router table").stdout
         self.assertRegex(table, rf"5001/tcp +{LAN2}:5001 +\d+ days left +libminiupnpc")

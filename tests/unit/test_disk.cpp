@@ -22,6 +22,7 @@ namespace fs = std::filesystem;
 
 bool gBlDirectoriesFail = false;
 int gNRenamesLeft = -1;
+bool gBlKilled = true;
 bool gBlExchanges = true;
 std::string gSzForeign;
 
@@ -570,7 +571,9 @@ int rename(const char* szFrom, const char* szTo) noexcept {
 
 int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsigned nFlags) noexcept {
     if (gNRenamesLeft >= 0 && gNRenamesLeft-- == 0) {
-        raise(SIGKILL);
+        raise(gBlKilled ? SIGKILL : 0);
+        errno = EIO;
+        return -1;
     }
     if (!gBlExchanges && nFlags == RENAME_EXCHANGE) {
         errno = EINVAL;

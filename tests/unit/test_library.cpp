@@ -237,6 +237,53 @@ TEST_F(Library, CompatibilityDatabaseOfTwoFiles) {
     EXPECT_FALSE(RouterUpnpDB("", "", "").IsValid());
 }
 
+// What the settings of a router say, as each of its readers tells it: the words, "yes" or not, and what it can do.
+TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
+    const struct {
+        const char* szAddress;
+        const char* szStored;
+        const char* szWords;  // UPnP, NAT-PMP, whether each is "yes", and the limit; "-": not told
+        int nDescribed;
+    } rgCases[] = {
+        {"192.168.1.1", "support_router_upnp=yes\nsupport_router_natpmp=no\nmax=5\n", "yes no 1 0 5", 0},
+        {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=unknown\n", "no unknown 0 0 -", 0},
+        {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=no\nmax=x\n", "no no 0 0 0", -1},
+        {"192.168.1.9", "support_router_upnp=yes\nsupport_router_natpmp=yes\nmax=5\n", "- - - - -", 0},
+        {"no address", "support_router_upnp=no\nsupport_router_natpmp=no\n", "- - - - -", -1},
+    };
+    for (const auto& stored : rgCases) {
+        Write(kRouterConf, std::string("[192.168.1.1]\n") + stored.szStored);
+        RouterConfReader reader(stored.szAddress);
+        std::string szUpnp, szNatpmp;
+        bool blUpnp = false, blNatpmp = false;
+        int nMax = 0;
+        const int rgAnswers[] = {reader.GetSupportUpnp(szUpnp), reader.GetSupportNatpmp(szNatpmp),
+                                 reader.GetSupportUpnp(blUpnp), reader.GetSupportNatpmp(blNatpmp),
+                                 reader.GetMaxRule(nMax)};
+        const std::string rgszTold[] = {szUpnp, szNatpmp, blUpnp ? "1" : "0", blNatpmp ? "1" : "0",
+                                        std::to_string(nMax)};
+        std::string szWords;
+        for (size_t i = 0; i < std::size(rgAnswers); ++i) {
+            szWords += (i == 0 ? "" : " ") + (rgAnswers[i] == 1 ? rgszTold[i] : "-");
+        }
+        EXPECT_EQ(szWords, stored.szWords) << stored.szStored;
+        __tag_TAVO_ROUTER_DESC desc = {true};
+        auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
+        EXPECT_EQ(TLibGetRouterDesc(stored.szAddress, &desc, &enErr, true), stored.nDescribed) << stored.szStored;
+        EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
+        EXPECT_FALSE(desc.blSupportChangePort);
+        EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+    }
+    auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
+    EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", nullptr, &enErr, false), -1);
+    ASSERT_EQ(TLibTavoPortMapLock(), 0);
+    __tag_TAVO_ROUTER_DESC desc = {true};
+    EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", &desc, &enErr, true), -1);
+    EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_CONFLICT);
+    EXPECT_EQ(TLibGetRouterDesc("192.168.1.9", &desc, nullptr, false), 0) << "it is not asked for the lock";
+    TLibTavoPortMapUnLock();
+}
+
 struct Capacity {
     const char* szPages;
     const char* szPorts;

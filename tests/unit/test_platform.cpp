@@ -10,6 +10,7 @@
 #include <functional>
 #include <thread>
 
+#include "ground/OwnFile.h"
 #include "ground/PortText.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
@@ -190,6 +191,36 @@ TEST(AtomicWrite, AFailureLeavesTheOldFileAndNothingElse) {
     EXPECT_EQ(Read("/var/victim"), "safe");
 }
 
+// Of what others may have put where a lock of ours belongs: what comes of it, and what stands there then.
+TEST(OwnFile, StandsWhereOthersHavePutSomethingOrItIsSaidThatItDoesNot) {
+    static constexpr char kOwn[] = "/tmp/t/own";
+    Write("/tmp/t/victim", "safe");
+    const std::tuple<const char*, std::function<void()>, int> rgCases[] = {
+        {"nothing", [] {}, 0},
+        {"a link", [] { symlink("/tmp/t/victim", kOwn); }, 0},
+        {"a second name of a file", [] { link("/tmp/t/victim", kOwn); }, 0},
+        {"a pipe", [] { mkfifo(kOwn, 0666); }, 0},
+        {"one that others write", [] { Write(kOwn, "theirs"), chmod(kOwn, 0666); }, 0},
+        {"a disk that fails", [] { gNRenamesLeft = 0; }, EIO}};
+    gBlKilled = false;
+    for (const auto& [szWhat, fnPlant, nErrno] : rgCases) {
+        std::filesystem::remove(kOwn);
+        fnPlant();
+        EXPECT_EQ(tavo::MakeOwnFile(kOwn), nErrno == 0) << szWhat;
+        EXPECT_TRUE(nErrno == 0 || errno == nErrno) << szWhat;
+        struct stat status = {};
+        EXPECT_EQ(lstat(kOwn, &status) == 0 && status.st_mode == (S_IFREG | 0600), nErrno == 0) << szWhat;
+        EXPECT_EQ(Read("/tmp/t/victim"), "safe");
+    }
+    gBlKilled = true;
+    gNRenamesLeft = -1;
+    Write(kOwn, "held");  // by one of ours
+    chmod(kOwn, 0600);
+    EXPECT_TRUE(tavo::MakeOwnFile(kOwn));
+    EXPECT_EQ(Read(kOwn), "held");
+    EXPECT_FALSE(tavo::MakeOwnFile("/tmp/t/nowhere/own"));
+}
+
 TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
     Write("/tmp/t/testupnp.sh", "#!/bin/sh\nwhile :; do /bin/sleep 1; done\n");
     chmod("/tmp/t/testupnp.sh", 0755);
@@ -248,7 +279,7 @@ TEST(Hooks, AreRunOnlyWhereNobodyButRootOwnsThem) {
     }
 }
 
-TEST(RouterDatabase, ARefreshThatIsKilledLosesNothing) {
+TEST(RouterDatabase, ARefreshThatIsKilledOrFailsLosesNothing) {
     const std::string szDatabase = "/etc.defaults/portforward/routerdb";
     Write("/usr/tavo/bin/wget", "#!/bin/sh\ncp /tmp/t/new.tgz \"$3\"\n");
     chmod("/usr/tavo/bin/wget", 0755);
@@ -279,6 +310,20 @@ TEST(RouterDatabase, ARefreshThatIsKilledLosesNothing) {
         }
         EXPECT_EQ(WEXITSTATUS(nStatus), 0);
     }
+    int nFailed = 0;
+    gBlKilled = false;
+    for (const int nCase : {0, 1, 2, 3, 10, 11, 12, 13}) {  // the first to fourth rename, with an exchange and without
+        fnMake(szDatabase, 7);
+        gBlExchanges = nCase < 10;
+        gNRenamesLeft = nCase % 10;
+        const int nEdition = TAVOPFRouterDBUpdate();
+        nFailed += nEdition < 0 ? 1 : 0;
+        EXPECT_EQ(nEdition < 0, *TAVOPFRouterDBWhy() != '\0') << nCase;
+        EXPECT_EQ(Read(szDatabase + "/version"), nEdition == 8 ? "version=\"8\"\n" : "version=\"7\"\n") << nCase;
+    }
+    EXPECT_EQ(nFailed, 2);
+    gBlKilled = gBlExchanges = true;
+    gNRenamesLeft = -1;
     const auto fnEntries = [] {
         return std::distance(std::filesystem::directory_iterator("/etc.defaults/portforward"), {});
     };

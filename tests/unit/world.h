@@ -19,8 +19,10 @@ extern std::string gSzFailRename;
 // After so many changes of a name or a file's rights the process dies at the next one (never: negative).
 extern int gNGoodChanges;
 inline constexpr int kKilled = 77;
-// Renames by renameat2 before the process is killed (never: negative), and whether the file system exchanges names.
+// Renames by renameat2 before one fails (never: negative), by the process's end or with an error, and whether the file
+// system exchanges names.
 extern int gNRenamesLeft;
+extern bool gBlKilled;
 extern bool gBlExchanges;
 // The file that another user owns; it takes no such user.
 extern std::string gSzForeign;
