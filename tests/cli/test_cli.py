@@ -483,6 +483,53 @@ class Tool(unittest.TestCase):
             self.expect("open 443 --to 8443", OK, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0 write")
             self.assertEqual(self.json("open", "443", "--to", "8443", **WRITES)[1]["outside_kind"], kind)
 
+    def test_the_outcome_of_a_save_is_what_the_daemon_says(self):
+        refused = (443, "tcp", {"state": "refused", "why": "taken", "holder": {"address": "192.168.77.7", "description": "console"}})
+        left = {"name": "8080/tcp", "address": "192.168.77.9", "why": "its former address", "until": None}
+        for rows, members, code, pattern in (
+                ((), {}, OK, "2 rules in force"),
+                ((refused,), {}, REFUSED, r"443/tcp +refused +taken \(192.168.77.7, console\)(?s:.)*Choose other router ports"),
+                (((53, "udp", {"state": "waiting", "why": "busy"}),), {}, REFUSED, "53/udp +not yet +busy"),
+                ((), {"left_over": [left]}, REFUSED, "8080/tcp +still on the router +its former address"),
+                ((refused,), {"router": "unreachable"}, AWAY, "nothing was refused, and nothing is known to be open"),
+                ((), {"router": "no_upnp"}, AWAY, "does not offer UPnP(?s:.)*switch UPnP on"),
+                ((), {"router": "silent"}, AWAY, "192.168.77.1 does not answer(?s:.)*restart the router")):
+            pid = self.keep()
+            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
+            self.publish(pid, *rows, at=int(time.time()) + 60, **members)
+            self.expect("save", code, pattern, **WRITES)
+            told = self.json("save", **WRITES)[1]
+            self.assertEqual(({port["name"] for port in told["ports"] if port["state"] != "open"}, len(told.get("left_over", []))),
+                             ({f"{port}/{protocol}" for port, protocol, _ in rows}, len(members.get("left_over", []))))
+        self.publish(pid, refused, at=int(time.time()) + 60)
+        self.expect("open 53/udp --yes", REFUSED, "(?s)443/tcp.*Port 53 itself, which was asked for, is open", **WRITES)
+
+    def test_setup_offers_what_listens_here_and_opens_what_is_chosen(self):
+        world = {**WRITES, "TAVO_DETECT": "0 0 0 1 1 0 32 10 20 30 40 70 50 80", "TAVO_WORD": "1 -1"}
+        with contextlib.ExitStack() as keep:
+            def listen(address, port, kind=socket.SOCK_STREAM):
+                made = keep.enter_context(socket.socket(socket.AF_INET, kind))
+                made.bind((address, port))
+                kind == socket.SOCK_STREAM and made.listen()
+            for address, port in (("0.0.0.0", 445), ("127.0.0.1", 7101), ("0.0.0.0", 7102), ("192.168.77.2", 7103), ("0.0.0.0", 7104)):
+                listen(address, port)
+            for port in (7105, 5353, 40000):  # the last is one that a program is given which only asks
+                listen("0.0.0.0", port, socket.SOCK_DGRAM)
+            self.store((1, "tcp", "80", "7104", "web"))
+            told = self.json("setup", "--yes", **world)[1]["could_be_opened"]
+            self.assertEqual([(entry["port"], entry["protocol"], bool(entry["risk"])) for entry in told],
+                             [(445, "tcp", True), (7102, "tcp", False), (7103, "tcp", False), (7105, "udp", False)])
+            self.expect("setup --yes", OK, "(?s)445 +\\S+ +better not: .*7105/udp.*'tavoportmap open 7102' opens the first", **world)
+            for typed, opened in ((b"\n", []), (b"no\n", []), (b"7102, 7105/udp\n", ["7102", "7105"]), (b"445\nn\n", [])):
+                self.store((1, "tcp", "80", "7104", "web"))
+                os.unlink(ROUTER)
+                code, text = on_terminal("setup", typed=typed, **world)
+                self.assertEqual([rule["router_ports"] for rule in self.in_force()], ["80", *opened], text)
+                self.assertEqual(code, FAILED if b"445" in typed else OK, text)
+            for port, words in (("7101", "only for this box itself \\(127.0.0.1\\): have it listen on every"),
+                                ("7109", "no program of this box waits at tcp port 7109 yet"), ("7103", "is open")):
+                self.expect(f"open {port}", OK, words, **world)
+
     def test_off_is_off_until_on(self):
         put(ROUTER, KNOWN % ("yes", "no"))
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
@@ -550,6 +597,13 @@ class Tool(unittest.TestCase):
         put(ROUTER, KNOWN % ("yes", "no"))
         tool("rules", "add", "--router-port", "81")
         self.expect("save", TOO_MANY, "holds 1 rule and there are 2")
+        put(ROUTER, KNOWN % ("no", "no"))
+        describe("Acme", "R1", "1")
+        for edit, code, pattern in (("add --router-port 82,83", OK, "open +80-83/tcp"),
+                                    ("add more --router-port 84", TOO_MANY, "holds 4 single ports and no ranges"),
+                                    ("edit more --router-port 84-85", TOO_MANY, "holds 4 single ports and no ranges")):
+            self.expect(f"rules {edit}", OK, "noted")
+            self.expect("save --dry-run", code, pattern, LD_PRELOAD=STAND_IN)
 
     def test_the_bar_never_goes_back_and_ends_its_line(self):
         steps = "10 20 30 40 70 50 80"
@@ -688,6 +742,11 @@ class Tool(unittest.TestCase):
         self.expect("router set --upnp no", OK, "stored as the settings")
         self.expect("router show --show-password", OK, "user +admin\npassword +n3w\nconnection +http, port 80")
         self.assertFalse(os.path.exists(f"{CONF}/router_account.conf"))
+        self.expect("router set --upnp yes", OK, "stored as the settings")
+        self.expect("router set --upnp no --conn-port 8080 --user other", USAGE, "no terminal to ask")
+        code, _, err = tool("router", "set", "--upnp", "no", "--conn-port", "8080", "--password-file", "-", stdin="n4w\n")
+        self.assertEqual(code, OK, err)
+        self.expect("router show --show-password", OK, "user +admin\npassword +n4w\nconnection +http, port 8080")
 
     def test_a_password_that_is_not_given_after_all_leaves_the_terminal_as_it_was(self):
         put(ROUTER, KNOWN % ("yes", "no"))

@@ -203,7 +203,8 @@ TEST(Notices, AHostileTextStaysAText) {
          "??????"
          "?1m"},
         {std::string(63, 'x') + "\xc3\xbc", std::string(63, 'x')},
-        {std::string("a\0b", 3), "ab"}};
+        {std::string("a\0b", 3), "ab"},
+        {"\xc2\x9f\xc2\xa0\xed\x9f\xbf\xf4\x8f\xbf\xbf", "??\xc2\xa0\xed\x9f\xbf\xf4\x8f\xbf\xbf"}};
     for (const auto& [szRaw, szHarmless] : rgTexts) {
         EXPECT_EQ(tavo::HarmlessText(szRaw, 64), szHarmless);
     }
