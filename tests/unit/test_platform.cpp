@@ -244,6 +244,25 @@ TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
     EXPECT_EQ(TLIBCSystem("exit 3"), 3);
 }
 
+// A daemon that ignored or blocked what its starter did would not hear of new rules.
+TEST(Process, WhatIsStartedHearsEverySignal) {
+    std::filesystem::remove("/tmp/t/signals");
+    sigset_t all, before;
+    sigfillset(&all);
+    sigprocmask(SIG_SETMASK, &all, &before);
+    signal(SIGHUP, SIG_IGN);
+    EXPECT_EQ(TLIBCExec("/bin/sh", "-c",
+                        "/bin/grep -E 'Sig(Blk|Ign)' /proc/self/status > /tmp/t/s && mv /tmp/t/s /tmp/t/signals",
+                        nullptr, nullptr),
+              0);
+    signal(SIGHUP, SIG_DFL);
+    sigprocmask(SIG_SETMASK, &before, nullptr);
+    for (int i = 0; i < 500 && !std::filesystem::exists("/tmp/t/signals"); ++i) {
+        usleep(10000);
+    }
+    EXPECT_EQ(Read("/tmp/t/signals"), "SigBlk:\t0000000000000000\nSigIgn:\t0000000000000000\n");
+}
+
 TEST(Process, StartsAreReportedTrulyInOddCallers) {
     int rgFdKept[2] = {dup(0), dup(1)};
     close(0);
