@@ -382,6 +382,7 @@ class Tool(unittest.TestCase):
         self.assertEqual({(port["action"], port["router_ports"], port["protocol"]) for port in told["ports"]},
                          {("keep", "80", "tcp"), ("refuse", "81", "tcp"), ("close", "53", "udp"), ("open", "6000-6002", "udp"),
                           ("refuse", "90", "tcp"), ("refuse", "5000", "tcp")})
+        self.assertEqual({port["router_ports"] for port in told["ports"] if port["why"]}, {"81", "90", "5000"})
         self.expect("save --dry-run", REFUSED, r"refuse +90/tcp +another device has it on the router \(192.168.77.99, console\\x1b", **world)
         self.expect("save --dry-run", REFUSED, r"refuse +81/tcp +to port 8081 of this box: rule \d+ wants it too", **world)
         tool("rules", "add", "--router-port", "91")
@@ -418,10 +419,11 @@ class Tool(unittest.TestCase):
         """Rules before, the command, its exit code and words, the rules in force then."""
         web, span = (1, "tcp", "443", "8443", "web"), (1, "all", "5000-5004", "5000-5004", "")
         off = lambda rule: (0, *rule[1:])
-        put("/etc/services", "domain 53/tcp\ndomain 53/udp\nzero 0/tcp\nodd 70000/tcp even\nother 7070/tcp even # odd\n")
+        put("/etc/services", "domain 53/tcp\ndomain 53/udp\nzero 0/tcp\nodd 70000/tcp even\nlast 65535/tcp\nother 7070/tcp even # odd\n")
         for before, command, code, pattern, after in (
                 ((), "open zero", USAGE, "'zero' is neither", ()),
                 ((), "open odd", USAGE, "'odd' is neither", ()),
+                ((), "open last", OK, "port 65535 .tcp.", ((1, "tcp", "65535", "65535", "last"),)),
                 ((), "open even", OK, "port 7070 .tcp.", ((1, "tcp", "7070", "7070", "even"),)),
                 ((), "open 443 --to 8443 --name web", OK, "port 443 .tcp. is open(?s:.)*leads to port 8443", (web,)),
                 ((web,), "open https --to 8443", OK, "was open already on the router and leads", (web,)),

@@ -189,6 +189,31 @@ TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
     }
 }
 
+// A widespread router daemon dies of a range with more than some hundred and thirty entries.
+TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
+    class Ranged : public MemoryRouter {
+    public:
+        RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
+                              std::vector<RouterMapping>& rgMappings) override {
+            mRgszRanges.push_back(szProtocol + " " + std::to_string(nFirst) + "-" + std::to_string(nLast));
+            return MemoryRouter::ListRange(szProtocol, nFirst, nLast, rgMappings);
+        }
+        std::vector<std::string> mRgszRanges;
+    };
+    std::vector<RouterMapping> rgWanted;
+    for (uint16_t nPort = 1; nPort <= 70; ++nPort) {
+        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+    }
+    for (const uint16_t nPort : {uint16_t{70}, uint16_t{71}, uint16_t{72}, uint16_t{73}, uint16_t{200}}) {
+        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+        rgWanted.back().szProtocol = "UDP";
+    }
+    Ranged router;
+    router.mNRangeCode = tavo::kWireOk;
+    Core().Run(router, rgWanted);
+    EXPECT_EQ(router.mRgszRanges, (std::vector<std::string>{"TCP 1-64", "TCP 65-70", "UDP 70-73"}));
+}
+
 TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
     MemoryRouter router;
     router.Put(Entry(1, 1, kBox, "tavo:old"));
