@@ -1,38 +1,17 @@
-// NAT-PMP requests, one at a time, each with its answer or the reason why there is none.
-// Relies on libnatpmp. Promises: see Client.h.
+// NAT-PMP requests, one at a time, each with its answer or the reason why there is none. Promises: see Client.h.
 #include "wire/pcp/Client.h"
 
 #include <arpa/inet.h>
-#include <poll.h>
-#include <sys/socket.h>
 
-#include <algorithm>
-#include <cerrno>
-#include <chrono>
 #include <utility>
+
+#include "wire/pcp/Exchange.h"
 
 namespace tavo {
 
 namespace {
 
-// The protocol would have a client send again after 250 ms, then after twice as long each time, up to
-// nine times: 64 s in all, for a router a few metres away that answers within milliseconds or never. A
-// user waits for a save, so we hear out five transmissions: 0.25 + 0.5 + 1 + 2 + 4 s.
-constexpr auto kAnswerLimit = std::chrono::milliseconds(7750);
-constexpr int kLeastPollMilliseconds = 10;
-constexpr int kMostPollMilliseconds = 100;  // so that a stop is seen soon
-
-// What reading found when it found no end yet: no code of ours, of the library's or of the protocol's.
-enum Unfinished : int { kNotYet = 1 << 16, kForeign };
-
-constexpr std::pair<int, int> kCodes[] = {{0, kWireOk},
-                                          {NATPMP_TRYAGAIN, kNotYet},
-                                          {NATPMP_ERR_UNSUPPORTEDVERSION, kNatpmpUnsupportedVersion},
-                                          {NATPMP_ERR_NOTAUTHORIZED, kNatpmpNotAuthorised},
-                                          {NATPMP_ERR_NETWORKFAILURE, kNatpmpNetworkFailure},
-                                          {NATPMP_ERR_OUTOFRESOURCES, kNatpmpOutOfResources},
-                                          {NATPMP_ERR_UNSUPPORTEDOPCODE, kNatpmpUnsupportedOpcode},
-                                          {NATPMP_ERR_NOGATEWAYSUPPORT, kWireTimeout}};  // after its last sending
+constexpr std::chrono::milliseconds kQuickLimit(750);  // asked twice
 
 constexpr std::pair<int, const char*> kWords[] = {{kWireTimeout, "no answer from the gateway"},
                                                   {kWireUnreachable, "the gateway cannot be reached by NAT-PMP"},
@@ -43,48 +22,22 @@ constexpr std::pair<int, const char*> kWords[] = {{kWireTimeout, "no answer from
                                                   {kNatpmpOutOfResources, "refused: out of resources"},
                                                   {kNatpmpUnsupportedOpcode, "refused: unsupported opcode"}};
 
-constexpr uint8_t kAnswerBit = 0x80;
-constexpr ssize_t kHeaderSize = 8;
-constexpr ssize_t kShortAnswerSize = 12;  // with an address, or with both ports
-constexpr ssize_t kMappingAnswerSize = 16;
-
-uint16_t Number16(const uint8_t* pBytes) {
-    return static_cast<uint16_t>(pBytes[0] << 8U | pBytes[1]);
+int CodeOf(ExchangeEnd enEnd, const NatpmpAnswer& answer) {
+    switch (enEnd) {
+        case ExchangeEnd::kAnswered:
+            return answer.blOtherVersion ? int{kNatpmpUnsupportedVersion} : answer.nResult;
+        case ExchangeEnd::kSilent:
+            return kWireTimeout;
+        case ExchangeEnd::kUnreachable:
+            return kWireUnreachable;
+        case ExchangeEnd::kGarbage:
+            break;
+    }
+    return kWireGarbage;
 }
 
-// Whether a datagram answers the question. One to a question of before may still have been under way.
-bool IsAnswer(const uint8_t* pDatagram, ssize_t nSize, const NatpmpQuestion& question) {
-    if (nSize < kHeaderSize || pDatagram[1] != (kAnswerBit | question.nOpcode)) {
-        return false;
-    }
-    if (pDatagram[0] != 0) {
-        return true;  // another version of the protocol, which is an answer too
-    }
-    const bool blRefusal = Number16(pDatagram + 2) != 0;
-    if (question.nOpcode == 0) {
-        return blRefusal || nSize >= kShortAnswerSize;
-    }
-    if (blRefusal && (nSize < kShortAnswerSize || Number16(pDatagram + 8) == 0)) {
-        return true;  // some leave the port out
-    }
-    if (Number16(pDatagram + 8) != question.nBoxPort || (!blRefusal && nSize < kMappingAnswerSize)) {
-        return false;
-    }
-    const bool blLasting = Number16(pDatagram + 12) != 0 || Number16(pDatagram + 14) != 0;
-    return blRefusal || (blLasting == question.blLasting && (!blLasting || Number16(pDatagram + 10) != 0));
-}
-
-// The library's answer codes as ours.
-int CodeOf(int nLibrary, const natpmpresp_t& answer) {
-    if (nLibrary == NATPMP_ERR_UNDEFINEDERROR) {
-        return answer.resultcode;
-    }
-    for (const auto& [nKnown, nCode] : kCodes) {
-        if (nKnown == nLibrary) {
-            return nCode;
-        }
-    }
-    return kWireUnreachable;
+NatpmpOpcode OpcodeOf(const std::string& szProtocol) {
+    return szProtocol == "TCP" ? kMapTcp : kMapUdp;
 }
 
 }  // namespace
@@ -99,89 +52,67 @@ std::string NatpmpWords(int nCode) {
 }
 
 NatpmpClient::NatpmpClient(const std::string& szGateway, std::function<bool()> fnStop,
-                           std::function<void(uint32_t)> fnEpoch)
-    : mFnStop(std::move(fnStop)), mFnEpoch(std::move(fnEpoch)) {
+                           std::function<void(uint32_t)> fnEpoch, std::chrono::milliseconds limit)
+    : mFnStop(std::move(fnStop)), mFnEpoch(std::move(fnEpoch)), mLimit(limit) {
     in_addr gateway = {};
-    mBlOpen = inet_pton(AF_INET, szGateway.c_str(), &gateway) == 1 && initnatpmp(&mHandle, 1, gateway.s_addr) == 0;
-}
-
-NatpmpClient::~NatpmpClient() {
-    if (mBlOpen) {
-        closenatpmp(&mHandle);
+    if (inet_pton(AF_INET, szGateway.c_str(), &gateway) == 1) {
+        mGateway = gateway;
     }
 }
 
-// Takes one datagram, or has the library send again when it is time.
-int NatpmpClient::Read(const NatpmpQuestion& question, natpmpresp_t& answer) {
-    uint8_t rgDatagram[kMappingAnswerSize] = {};
-    const ssize_t nSize = recv(mHandle.s, rgDatagram, sizeof(rgDatagram), MSG_PEEK | MSG_TRUNC | MSG_DONTWAIT);
-    if (nSize < 0 && errno != EAGAIN) {
-        return kWireUnreachable;  // above all: nobody listens at the gateway's port
-    }
-    if (nSize >= 0 && !IsAnswer(rgDatagram, nSize, question)) {
-        recv(mHandle.s, nullptr, 0, MSG_DONTWAIT);  // a datagram is gone when any of it was read
-        return kForeign;
-    }
-    return CodeOf(readnatpmpresponseorretry(&mHandle, &answer), answer);
-}
-
-int NatpmpClient::Ask(const NatpmpQuestion& question, int nSent, natpmpresp_t& answer) {
-    if (nSent < 0) {
+int NatpmpClient::Ask(const NatpmpQuestion& question, NatpmpAnswer& answer) {
+    if (!mGateway) {
         return kWireUnreachable;
     }
-    const auto end = std::chrono::steady_clock::now() + kAnswerLimit;
-    int nFailure = kWireTimeout;
-    while (std::chrono::steady_clock::now() < end && !mFnStop()) {
-        timeval left = {};
-        getnatpmprequesttimeout(&mHandle, &left);
-        const long nLeft = left.tv_sec * 1000 + left.tv_usec / 1000;
-        pollfd waiting = {mHandle.s, POLLIN, 0};
-        poll(&waiting, 1, static_cast<int>(std::clamp<long>(nLeft, kLeastPollMilliseconds, kMostPollMilliseconds)));
-        const int nCode = Read(question, answer);
-        if (nCode == kWireOk) {
-            mFnEpoch(answer.epoch);
-        }
-        if (nCode != kNotYet && nCode != kForeign) {
-            return nCode;
-        }
-        nFailure = nCode == kForeign ? kWireGarbage : nFailure;
-    }
-    return nFailure;
-}
-
-int NatpmpClient::AskAddress(std::string& szAddress) {
-    natpmpresp_t answer = {};
-    const int nCode = mBlOpen ? Ask({0, 0, false}, sendpublicaddressrequest(&mHandle), answer) : int{kWireUnreachable};
-    char szText[INET_ADDRSTRLEN] = {};
-    if (nCode == kWireOk) {
-        szAddress = inet_ntop(AF_INET, &answer.pnu.publicaddress.addr, szText, sizeof(szText));
+    const auto fnTake = [&](std::span<const uint8_t> rgDatagram) {
+        const auto read = ReadAnswer(rgDatagram, question);
+        answer = read.value_or(NatpmpAnswer());
+        return read.has_value();
+    };
+    const int nCode = CodeOf(Exchange(*mGateway, BytesOf(question), mLimit, fnTake, mFnStop), answer);
+    if (nCode == kWireOk && mFnEpoch) {
+        mFnEpoch(answer.nEpoch);
     }
     return nCode;
 }
 
-int NatpmpClient::AskMapping(const std::string& szProtocol, uint16_t nBoxPort, uint16_t nRouterPort, uint32_t nLifetime,
-                             natpmpresp_t& answer) {
-    if (!mBlOpen) {
-        return kWireUnreachable;
+int NatpmpClient::AskAddress(std::string& szAddress) {
+    NatpmpAnswer answer;
+    const int nCode = Ask({}, answer);
+    char szText[INET_ADDRSTRLEN] = {};
+    if (nCode == kWireOk) {
+        szAddress = inet_ntop(AF_INET, &answer.address, szText, sizeof(szText));
     }
-    const uint8_t nOpcode = szProtocol == "TCP" ? NATPMP_PROTOCOL_TCP : NATPMP_PROTOCOL_UDP;
-    const int nSent = sendnewportmappingrequest(&mHandle, nOpcode, nBoxPort, nRouterPort, nLifetime);
-    return Ask({nOpcode, nBoxPort, nLifetime != 0}, nSent, answer);
+    return nCode;
 }
 
 int NatpmpClient::Map(const std::string& szProtocol, uint16_t nBoxPort, uint16_t nRouterPort, uint32_t nLifetime,
                       NatpmpGrant& grant) {
-    natpmpresp_t answer = {};
-    const int nCode = AskMapping(szProtocol, nBoxPort, nRouterPort, nLifetime, answer);
+    NatpmpAnswer answer;
+    const int nCode = Ask({OpcodeOf(szProtocol), nBoxPort, nRouterPort, nLifetime}, answer);
     if (nCode == kWireOk) {
-        grant = {answer.pnu.newportmapping.mappedpublicport, answer.pnu.newportmapping.lifetime};
+        grant = {answer.nRouterPort, answer.nLifetime};
     }
     return nCode;
 }
 
 int NatpmpClient::Unmap(const std::string& szProtocol, uint16_t nBoxPort) {
-    natpmpresp_t answer = {};
-    return AskMapping(szProtocol, nBoxPort, 0, 0, answer);
+    NatpmpAnswer answer;
+    return Ask({OpcodeOf(szProtocol), nBoxPort, 0, 0}, answer);
+}
+
+NatPmpWord AskNatPmp(const std::string& szGateway) {
+    NatPmpWord word;
+    std::string szAddress;
+    in_addr address = {};
+    const int nCode = NatpmpClient(szGateway, {}, {}, kQuickLimit).AskAddress(szAddress);
+    if (nCode >= 0 && nCode != kNatpmpUnsupportedVersion) {
+        word.nCode = nCode;
+    }
+    if (nCode == kWireOk && inet_pton(AF_INET, szAddress.c_str(), &address) == 1 && address.s_addr != 0) {
+        word.address = address;
+    }
+    return word;
 }
 
 }  // namespace tavo

@@ -18,7 +18,7 @@
 #include "platform/linux/net/Reachability.h"
 #include "tavo/net.h"
 #include "wire/icmp/HopProbe.h"
-#include "wire/pcp/PublicAddress.h"
+#include "wire/pcp/Client.h"
 #include "wire/upnp/GatewayMemory.h"
 
 namespace {
@@ -111,7 +111,7 @@ std::optional<in_addr> AskUpnp() {
 }
 
 std::optional<in_addr> ExternalAddress(const std::string& szGateway) {
-    const auto address = tavo::AskNatPmp(AddressOf(szGateway)).address;
+    const auto address = tavo::AskNatPmp(szGateway).address;
     return address ? address : AskUpnp();
 }
 
@@ -227,7 +227,7 @@ int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
         if (pWord == nullptr || szGateway.empty()) {
             return Fail(pWord == nullptr ? TLIBC_ERR_BAD_PARAMETER : TLIBC_ERR_NOT_FOUND, __LINE__);
         }
-        const tavo::NatPmpWord natpmp = tavo::AskNatPmp(AddressOf(szGateway));
+        const tavo::NatPmpWord natpmp = tavo::AskNatPmp(szGateway);
         const auto outside = natpmp.address ? natpmp.address : AskUpnp();
         *pWord = {};
         std::snprintf(pWord->szGateway, sizeof(pWord->szGateway), "%s", szGateway.c_str());
