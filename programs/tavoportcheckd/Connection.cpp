@@ -1,4 +1,4 @@
-// Reads a request, decides whether it is served, probes, answers. Relies on HttpRequest for HTTP.
+// Reads a request, decides whether it is served, probes, answers. Relies on wire/http for HTTP.
 // Promises: see Connection.h.
 #include "programs/tavoportcheckd/Connection.h"
 
@@ -12,8 +12,8 @@
 #include <vector>
 
 #include "ground/SysLog.h"
-#include "programs/tavoportcheckd/HttpRequest.h"
 #include "programs/tavoportcheckd/Prober.h"
+#include "wire/http/Request.h"
 #include "wire/portcheck/Protocol.h"
 
 namespace tavo {

@@ -1,9 +1,8 @@
 // Reads and parses; whatever is not plainly a request is none. Relies on nothing but the socket. Promises: see
-// HttpRequest.h.
-#include "programs/tavoportcheckd/HttpRequest.h"
+// Request.h.
+#include "wire/http/Request.h"
 
 #include <poll.h>
-#include <strings.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -22,16 +21,6 @@ constexpr size_t kMaxHeaders = 40;
 constexpr size_t kMaxBody = 24U << 10U;
 constexpr std::string_view kLineEnd = "\r\n";
 constexpr std::string_view kHeadEnd = "\r\n\r\n";
-constexpr std::string_view kBlanks = " \t";
-
-std::string_view Trim(std::string_view szText) {
-    const size_t nStart = szText.find_first_not_of(kBlanks);
-    return nStart == szText.npos ? "" : szText.substr(nStart, szText.find_last_not_of(kBlanks) + 1 - nStart);
-}
-
-bool IsSameWord(std::string_view szOne, std::string_view szOther) {
-    return szOne.size() == szOther.size() && strncasecmp(szOne.data(), szOther.data(), szOne.size()) == 0;
-}
 
 }  // namespace
 
@@ -102,28 +91,30 @@ HttpFault HttpRequest::ParseHead(std::string_view szHead) {
         szHead.remove_prefix(kLineEnd.size());
         const std::string_view szLine = szHead.substr(0, szHead.find(kLineEnd));
         szHead.remove_prefix(szLine.size());
-        const size_t nColon = szLine.find(':');
-        // A blank before the colon, or a line that goes on with the one before: two readers may differ on it.
-        if (nColon == std::string_view::npos || nColon == 0 || szLine.find_first_of(kBlanks) < nColon) {
-            return HttpFault::kNoRequest;
-        }
-        if (mRgHeaders.size() == kMaxHeaders) {
+        if (mHeaders.Size() == kMaxHeaders) {
             return HttpFault::kTooManyHeaders;
         }
-        mRgHeaders.emplace_back(szLine.substr(0, nColon), Trim(szLine.substr(nColon + 1)));
+        if (!mHeaders.Add(szLine)) {
+            return HttpFault::kNoRequest;
+        }
     }
     return HttpFault::kNone;
 }
 
-HttpFault HttpRequest::ReadBody(BoundedSocket& socket) {
+HttpFault HttpRequest::ReadLength(size_t& nLength) const {
     const std::string szLength = Header("Content-Length").value_or("");
-    size_t nLength = 0;
     const auto [pEnd, enError] = std::from_chars(szLength.data(), szLength.data() + szLength.size(), nLength);
     if (enError == std::errc::result_out_of_range || nLength > kMaxBody) {
         return HttpFault::kTooLong;
     }
-    if (enError != std::errc() || pEnd != szLength.data() + szLength.size() || Header("Transfer-Encoding")) {
-        return HttpFault::kNoLength;
+    const bool blPlain = enError == std::errc() && pEnd == szLength.data() + szLength.size();
+    return blPlain && !Header("Transfer-Encoding") ? HttpFault::kNone : HttpFault::kNoLength;
+}
+
+HttpFault HttpRequest::ReadBody(BoundedSocket& socket) {
+    size_t nLength = 0;
+    if (const HttpFault enFault = ReadLength(nLength); enFault != HttpFault::kNone) {
+        return enFault;
     }
     if (mSzBody.size() < nLength && IsSameWord(Header("Expect").value_or(""), "100-continue")) {
         socket.Write("HTTP/1.1 100 Continue\r\n\r\n");
@@ -137,10 +128,20 @@ HttpFault HttpRequest::ReadBody(BoundedSocket& socket) {
     return HttpFault::kNone;
 }
 
-std::optional<std::string> HttpRequest::Header(std::string_view szName) const {
-    const auto it = std::find_if(mRgHeaders.rbegin(), mRgHeaders.rend(),
-                                 [&](const auto& header) { return IsSameWord(header.first, szName); });
-    return it == mRgHeaders.rend() ? std::nullopt : std::optional(it->second);
+HttpFault HttpRequest::Parse(std::string_view szText) {
+    const size_t nEnd = szText.find(kHeadEnd);
+    if (nEnd == szText.npos) {
+        return HttpFault::kGone;
+    }
+    size_t nLength = 0;
+    HttpFault enFault = ParseHead(szText.substr(0, nEnd));
+    enFault = enFault == HttpFault::kNone ? ReadLength(nLength) : enFault;
+    mSzBody = szText.substr(nEnd + kHeadEnd.size());
+    if (enFault == HttpFault::kNone && mSzBody.size() < nLength) {
+        return HttpFault::kGone;
+    }
+    mSzBody.resize(std::min(mSzBody.size(), nLength));
+    return enFault;
 }
 
 }  // namespace tavo

@@ -1,14 +1,15 @@
-// One HTTP request as the port checker takes it. Relies on poll; no library's server knows a limit for the whole of a
-// request, nor one for its headers. Promises: reading ends within a bounded time and a bounded number of bytes,
-// whatever the client sends; a body has a stated length, no encoding, and is read only when it is asked for.
+// One HTTP request as those of our programs take it that answer some. Relies on poll; no library's server knows a limit
+// for the whole of a request, nor one for its headers. Promises: reading ends within a bounded time and a bounded
+// number of bytes, whatever the client sends; a body has a stated length, no encoding, and is read only when it is
+// asked for.
 #pragma once
 
 #include <chrono>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <utility>
-#include <vector>
+
+#include "wire/http/Headers.h"
 
 namespace tavo {
 
@@ -38,20 +39,23 @@ public:
     HttpFault ReadHead(BoundedSocket& socket);
     // The rest, after "100 Continue" where the client waits for that.
     HttpFault ReadBody(BoundedSocket& socket);
+    // Both, of what has come so far, for somebody who does not wait. kGone: it is not whole yet.
+    HttpFault Parse(std::string_view szText);
 
     const std::string& Method() const { return mSzMethod; }
     const std::string& Path() const { return mSzPath; }
     const std::string& Body() const { return mSzBody; }
     // The last of that name, whose case does not matter; nothing where there is none.
-    std::optional<std::string> Header(std::string_view szName) const;
+    std::optional<std::string> Header(std::string_view szName) const { return mHeaders.Find(szName); }
 
 private:
     HttpFault ParseHead(std::string_view szHead);
+    HttpFault ReadLength(size_t& nLength) const;
 
     std::string mSzMethod;
     std::string mSzPath;
     std::string mSzBody;
-    std::vector<std::pair<std::string, std::string>> mRgHeaders;
+    HttpHeaders mHeaders;
 };
 
 }  // namespace tavo
