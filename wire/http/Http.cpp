@@ -16,6 +16,7 @@ namespace {
 
 constexpr long kConnectMilliseconds = 3000;
 constexpr size_t kMaxBody = 256U << 10U;
+constexpr size_t kMaxHead = 32U << 10U;
 
 // Refusing a byte makes libcurl end the transfer.
 size_t TakeBody(char* pData, size_t nSize, size_t nCount, void* pUser) {
@@ -26,6 +27,24 @@ size_t TakeBody(char* pData, size_t nSize, size_t nCount, void* pUser) {
     }
     pBody->append(pData, nBytes);
     return nBytes;
+}
+
+struct Head {
+    HttpHeaders headers;
+    size_t nBytes = 0;
+};
+
+// One line at a time.
+size_t TakeHead(char* pData, size_t nSize, size_t nCount, void* pUser) {
+    auto* pHead = static_cast<Head*>(pUser);
+    std::string_view szLine(pData, nSize * nCount);
+    pHead->nBytes += szLine.size();
+    if (pHead->nBytes > kMaxHead) {
+        return 0;
+    }
+    szLine = szLine.substr(0, szLine.find_last_not_of("\r\n") + 1);
+    pHead->headers.Add(szLine);
+    return nSize * nCount;
 }
 
 // Asked at least once a second while a request lasts; anything but 0 ends it.
@@ -108,25 +127,33 @@ void HttpClient::SetStop(std::function<bool()> fnStop) {
 }
 
 HttpAnswer HttpClient::Get(const HttpUrl& url) {
-    return Perform(url, {}, nullptr);
+    Prepare(url);
+    return Perform({});
 }
 
 HttpAnswer HttpClient::Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
                             const std::string& szBody) {
-    return Perform(url, rgszHeaders, &szBody);
+    Prepare(url);
+    curl_easy_setopt(mPImpl->pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(szBody.size()));
+    curl_easy_setopt(mPImpl->pCurl, CURLOPT_POSTFIELDS, szBody.c_str());
+    return Perform(rgszHeaders);
 }
 
-HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
-                               const std::string* pSzBody) {
-    HttpAnswer answer;
+HttpAnswer HttpClient::Ask(const std::string& szMethod, const HttpUrl& url,
+                           const std::vector<std::string>& rgszHeaders) {
+    Prepare(url);
+    curl_easy_setopt(mPImpl->pCurl, CURLOPT_NOBODY, 1L);
+    curl_easy_setopt(mPImpl->pCurl, CURLOPT_CUSTOMREQUEST, szMethod.c_str());
+    return Perform(rgszHeaders);
+}
+
+void HttpClient::Prepare(const HttpUrl& url) {
     CURL* pCurl = mPImpl->pCurl;
     if (pCurl == nullptr) {
-        return answer;
+        return;
     }
     curl_easy_reset(pCurl);  // keeps the open connection
-    const HeaderList pHeaders = MakeHeaders(rgszHeaders);
-    const std::string szUrl = url.Text();
-    curl_easy_setopt(pCurl, CURLOPT_URL, szUrl.c_str());
+    curl_easy_setopt(pCurl, CURLOPT_URL, url.Text().c_str());
     curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, url.blTls ? "https" : "http");
     curl_easy_setopt(pCurl, CURLOPT_IPRESOLVE, CURL_IPRESOLVE_V4);
     curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
@@ -136,18 +163,27 @@ HttpAnswer HttpClient::Perform(const HttpUrl& url, const std::vector<std::string
     curl_easy_setopt(pCurl, CURLOPT_CONNECTTIMEOUT_MS, std::min(kConnectMilliseconds, mPImpl->nLimitMilliseconds));
     curl_easy_setopt(pCurl, CURLOPT_TIMEOUT_MS, mPImpl->nLimitMilliseconds);
     curl_easy_setopt(pCurl, CURLOPT_USERAGENT, "Linux UPnP/1.1 tavo/1.0");
-    curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
+    curl_easy_setopt(pCurl, CURLOPT_HEADERFUNCTION, &TakeHead);
     curl_easy_setopt(pCurl, CURLOPT_WRITEFUNCTION, &TakeBody);
-    curl_easy_setopt(pCurl, CURLOPT_WRITEDATA, &answer.szBody);
     curl_easy_setopt(pCurl, CURLOPT_NOPROGRESS, 0L);
     curl_easy_setopt(pCurl, CURLOPT_XFERINFOFUNCTION, &AskStop);
     curl_easy_setopt(pCurl, CURLOPT_XFERINFODATA, &mPImpl->fnStop);
-    if (pSzBody != nullptr) {
-        curl_easy_setopt(pCurl, CURLOPT_POSTFIELDSIZE, static_cast<long>(pSzBody->size()));
-        curl_easy_setopt(pCurl, CURLOPT_POSTFIELDS, pSzBody->c_str());
+}
+
+HttpAnswer HttpClient::Perform(const std::vector<std::string>& rgszHeaders) {
+    HttpAnswer answer;
+    CURL* pCurl = mPImpl->pCurl;
+    if (pCurl == nullptr) {
+        return answer;
     }
+    Head head;
+    const HeaderList pHeaders = MakeHeaders(rgszHeaders);
+    curl_easy_setopt(pCurl, CURLOPT_HTTPHEADER, pHeaders.get());
+    curl_easy_setopt(pCurl, CURLOPT_HEADERDATA, &head);
+    curl_easy_setopt(pCurl, CURLOPT_WRITEDATA, &answer.szBody);
     answer.enEnd = EndOf(curl_easy_perform(pCurl));
     curl_easy_getinfo(pCurl, CURLINFO_RESPONSE_CODE, &answer.nCode);
+    answer.headers = std::move(head.headers);
     return answer;
 }
 

@@ -1,5 +1,5 @@
 // HTTP towards a router, or a service, that may be broken or hostile. Relies on libcurl.
-// Promises: every request ends within its deadline and its body within its bound; no redirects, no
+// Promises: every request ends within its deadline, its headers and its body within their bounds; no redirects, no
 // proxies, no other host than the one given, and that by IPv4, of which all mappings are.
 #pragma once
 
@@ -8,6 +8,8 @@
 #include <optional>
 #include <string>
 #include <vector>
+
+#include "wire/http/Headers.h"
 
 namespace tavo {
 
@@ -31,6 +33,7 @@ struct HttpAnswer {
     HttpEnd enEnd = HttpEnd::kUnreachable;
     long nCode = 0;
     std::string szBody;
+    HttpHeaders headers = {};
 };
 
 // The most that a request to a router takes.
@@ -43,6 +46,11 @@ public:
     virtual HttpAnswer Get(const HttpUrl& url) = 0;
     virtual HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
                             const std::string& szBody) = 0;
+    // A request of any other method, without a body; that of the answer is not waited for.
+    virtual HttpAnswer Ask(const std::string& /*szMethod*/, const HttpUrl& /*url*/,
+                           const std::vector<std::string>& /*rgszHeaders*/) {
+        return {};
+    }
     // The most that one request may take from now on.
     virtual void SetLimit(int /*nMilliseconds*/) {}
     // Requests end, as timeouts, within a second of the moment from which fnStop answers true.
@@ -61,11 +69,14 @@ public:
     HttpAnswer Get(const HttpUrl& url) override;
     HttpAnswer Post(const HttpUrl& url, const std::vector<std::string>& rgszHeaders,
                     const std::string& szBody) override;
+    HttpAnswer Ask(const std::string& szMethod, const HttpUrl& url,
+                   const std::vector<std::string>& rgszHeaders) override;
     void SetLimit(int nMilliseconds) override;
     void SetStop(std::function<bool()> fnStop) override;
 
 private:
-    HttpAnswer Perform(const HttpUrl& url, const std::vector<std::string>& rgszHeaders, const std::string* pSzBody);
+    void Prepare(const HttpUrl& url);
+    HttpAnswer Perform(const std::vector<std::string>& rgszHeaders);
 
     struct Impl;
     std::unique_ptr<Impl> mPImpl;
