@@ -1,0 +1,342 @@
+// What a router tells its subscribers: how one subscribes, and what of all that comes to the ear is news.
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <chrono>
+#include <deque>
+#include <memory>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "ground/Descriptor.h"
+#include "wire/upnp/Events.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+using tavo::HttpEnd;
+
+constexpr char kRouter[] = "127.0.0.1";
+constexpr char kNeighbour[] = "127.0.0.2";
+const tavo::HttpUrl kService{kRouter, 5000, "/evt"};
+
+// Answers subscriptions; the notices go over real sockets.
+class Subscriptions : public tavo::HttpTransport {
+public:
+    tavo::HttpAnswer Get(const tavo::HttpUrl&) override { return {}; }
+    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string&) override {
+        return {};
+    }
+    tavo::HttpAnswer Ask(const std::string& szMethod, const tavo::HttpUrl& url,
+                         const std::vector<std::string>& rgszHeaders) override {
+        EXPECT_EQ(url.Text(), kService.Text());
+        std::string szAsked = szMethod;
+        for (const std::string& szHeader : rgszHeaders) {
+            const bool blCallback = szHeader.starts_with("CALLBACK: <http://127.0.0.1:");
+            szAsked += blCallback ? " CALLBACK" : " " + szHeader;
+            mSzCallback = blCallback ? szHeader.substr(std::string("CALLBACK: <").size()) : mSzCallback;
+        }
+        mRgszAsked.push_back(szAsked);
+        if (mRgAnswers.empty()) {
+            return {HttpEnd::kTimeout, 0, ""};
+        }
+        tavo::HttpAnswer answer = mRgAnswers.front();
+        mRgAnswers.pop_front();
+        return answer;
+    }
+    void Grant(const std::vector<std::string>& rgszHeaders) { Say(200, rgszHeaders); }
+    void Say(long nCode, const std::vector<std::string>& rgszHeaders = {}) {
+        tavo::HttpAnswer answer{HttpEnd::kAnswered, nCode, ""};
+        for (const std::string& szHeader : rgszHeaders) {
+            answer.headers.Add(szHeader);
+        }
+        mRgAnswers.push_back(answer);
+    }
+    std::vector<std::string> TakeAsked() { return std::exchange(mRgszAsked, {}); }
+    uint16_t Port() const {
+        return static_cast<uint16_t>(std::stoi(mSzCallback.substr(std::string("http://127.0.0.1:").size())));
+    }
+    std::string Path() const {
+        const size_t nPath = mSzCallback.find('/', std::string("http://").size());
+        return mSzCallback.substr(nPath, mSzCallback.find('>') - nPath);
+    }
+
+private:
+    std::vector<std::string> mRgszAsked;
+    std::deque<tavo::HttpAnswer> mRgAnswers;
+    std::string mSzCallback;
+};
+
+class EventsTest : public testing::Test {
+protected:
+    void Subscribe() {
+        mPRouter->Grant({"SID: uuid:1", "TIMEOUT: Second-1800"});
+        mEvents.TurnTo(kService, kRouter);
+        mEvents.Keep(mNow, {});
+        ASSERT_TRUE(mEvents.IsSubscribed());
+        mPRouter->TakeAsked();
+    }
+    tavo::Descriptor Connect(const char* szFrom = kRouter) const {
+        tavo::Descriptor fd(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_in address = {};
+        address.sin_family = AF_INET;
+        inet_pton(AF_INET, szFrom, &address.sin_addr);
+        EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+        inet_pton(AF_INET, kRouter, &address.sin_addr);
+        address.sin_port = htons(mPRouter->Port());
+        EXPECT_EQ(connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+        return fd;
+    }
+    static void Send(const tavo::Descriptor& fd, const std::string& szText) {
+        send(fd.Get(), szText.data(), szText.size(), MSG_NOSIGNAL);
+    }
+    // The code of the answer; "" when the connection was closed without one, "-" when it is still open.
+    static std::string Answer(const tavo::Descriptor& fd) {
+        char szText[200] = {};
+        const ssize_t nRead = recv(fd.Get(), szText, sizeof(szText) - 1, MSG_DONTWAIT);
+        return nRead < 0 && errno == EAGAIN ? "-" : std::string(szText).substr(0, 12);
+    }
+    std::string Notice(uint32_t nNumber, const std::string& szBody, const std::string& szSubscription = "uuid:1",
+                       const std::string& szMethod = "NOTIFY") const {
+        return szMethod + " " + mPRouter->Path() +
+               " HTTP/1.1\r\nHost: x\r\nNT: upnp:event\r\nNTS: upnp:propchange\r\n" + "SID: " + szSubscription +
+               "\r\nSEQ: " + std::to_string(nNumber) + "\r\nContent-Length: " + std::to_string(szBody.size()) +
+               "\r\n\r\n" + szBody;
+    }
+    // Sends it and looks whether it is news.
+    bool IsNews(const std::string& szText, std::string* pSzAnswer = nullptr) {
+        const tavo::Descriptor fd = Connect();
+        Send(fd, szText);
+        const bool blNews = mEvents.TakeNews();
+        if (pSzAnswer != nullptr) {
+            *pSzAnswer = Answer(fd);
+        }
+        return blNews;
+    }
+
+    tavo::BootClock::time_point mNow = tavo::BootClock::now();
+    std::shared_ptr<Subscriptions> mPRouter = std::make_shared<Subscriptions>();
+    tavo::Events mEvents{mPRouter};
+};
+
+constexpr char kCount[] = "<e:propertyset><e:property><PortMappingNumberOfEntries>3</PortMappingNumberOfEntries>";
+constexpr char kState[] = "<e:propertyset><e:property><ConnectionStatus>Connected</ConnectionStatus>";
+constexpr char kOk[] = "HTTP/1.1 200";
+
+TEST_F(EventsTest, ASubscriptionIsKeptAndEnded) {
+    using Asked = std::vector<std::string>;
+    const std::string szSubscribe = "SUBSCRIBE CALLBACK NT: upnp:event TIMEOUT: Second-1800";
+    const std::string szRenew = "SUBSCRIBE SID: uuid:1 TIMEOUT: Second-1800";
+    mEvents.Keep(mNow, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked()) << "no service, nothing to subscribe to";
+    mPRouter->Grant({"sid:uuid:1", "Timeout: second-600"});
+    mEvents.TurnTo(kService, kRouter);
+    mEvents.Keep(mNow, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked{szSubscribe});
+    const std::string szPath = mPRouter->Path();
+    mEvents.Keep(mNow + 299s, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked()) << "not before half of what was granted";
+    mPRouter->Grant({"SID: uuid:1", "TIMEOUT: infinite"});
+    mEvents.Keep(mNow + 301s, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked{szRenew});
+    mEvents.Keep(mNow + 1200s, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked()) << "a term without an end is renewed all the same, but later";
+    // The router has forgotten us: at once anew, and by another path.
+    mPRouter->Say(412);
+    mPRouter->Grant({"SID: uuid:2"});
+    mEvents.Keep(mNow + 1202s, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), (Asked{szRenew, szSubscribe}));
+    EXPECT_NE(mPRouter->Path(), szPath);
+    mEvents.TurnTo(kService, kRouter);
+    mPRouter->Grant({});
+    mEvents.Keep(mNow + 1203s, {});
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked{"SUBSCRIBE SID: uuid:2 TIMEOUT: Second-1800"})
+        << "one that was found anew may have forgotten us";
+    mEvents.End();
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked{"UNSUBSCRIBE SID: uuid:2"});
+    EXPECT_EQ(mEvents.Fds(), std::vector<int>{-1});
+    mEvents.End();
+    EXPECT_EQ(mPRouter->TakeAsked(), Asked());
+}
+
+TEST_F(EventsTest, ARouterThatWillNotIsLeftAloneForAWhile) {
+    const auto fnAsk = [this](const char* szWhat) {
+        mEvents.TurnTo(kService, kRouter);
+        mEvents.Keep(mNow, {});
+        EXPECT_FALSE(mEvents.IsSubscribed()) << szWhat;
+        EXPECT_EQ(mEvents.Fds(), std::vector<int>{-1}) << szWhat << ": nobody is listened for";
+        EXPECT_EQ(mPRouter->TakeAsked().size(), 1U) << szWhat;
+        mEvents.Keep(mNow + 120s, {});
+        EXPECT_EQ(mPRouter->TakeAsked().size(), 0U) << szWhat;
+    };
+    mPRouter->Say(501);
+    fnAsk("refused");
+    mPRouter->Grant({"TIMEOUT: Second-1800"});
+    fnAsk("no name");
+    mPRouter->Grant({"SID: " + std::string(300, 'x')});
+    fnAsk("a name without end");
+    fnAsk("silent");
+    mPRouter->Grant({"SID: uuid:9"});
+    mEvents.Keep(mNow + 11min, {});
+    EXPECT_TRUE(mEvents.IsSubscribed());
+}
+
+TEST_F(EventsTest, NewsIsWhatNamesOurTableAndWhatCountsAnew) {
+    Subscribe();
+    struct Case {
+        const char* szWhat;
+        uint32_t nNumber;
+        const char* szBody;
+        bool blNews;
+    };
+    const Case rgCases[] = {{"how things stand", 0, kCount, false},
+                            {"the table", 1, kCount, true},
+                            {"something else", 2, kState, false},
+                            {"the address", 3, "<ExternalIPAddress>198.41.0.4</ExternalIPAddress>", true},
+                            {"a table of the second generation", 4, "<SystemUpdateID>7</SystemUpdateID>", true},
+                            {"nothing", 5, "", false},
+                            {"one was lost", 7, kState, true},
+                            {"it goes on", 8, kState, false},
+                            {"it counts anew", 0, kState, true},
+                            {"it goes on again", 1, kState, false},
+                            {"the last number", UINT32_MAX, kState, true},
+                            {"after which comes 1", 1, kState, false}};
+    for (const Case& one : rgCases) {
+        std::string szAnswer;
+        EXPECT_EQ(IsNews(Notice(one.nNumber, one.szBody), &szAnswer), one.blNews) << one.szWhat;
+        EXPECT_EQ(szAnswer, kOk) << one.szWhat;
+    }
+}
+
+TEST_F(EventsTest, WhatIsNoNoticeOfOursIsNoNews) {
+    Subscribe();
+    const std::string szGood = Notice(1, kCount);
+    const auto fnWithout = [&](const std::string& szHeader) {
+        const size_t nAt = szGood.find(szHeader);
+        return szGood.substr(0, nAt) + szGood.substr(szGood.find("\r\n", nAt) + 2);
+    };
+    struct Case {
+        const char* szWhat;
+        std::string szText;
+        std::string szAnswer;
+    };
+    const Case rgCases[] = {
+        {"another subscription", Notice(1, kCount, "uuid:11"), "HTTP/1.1 412"},
+        {"no subscription", fnWithout("SID:"), "HTTP/1.1 412"},
+        {"no number", fnWithout("SEQ:"), "HTTP/1.1 400"},
+        {"no length", fnWithout("Content-Length:"), "HTTP/1.1 400"},
+        {"another method", Notice(1, kCount, "uuid:1", "POST"), "HTTP/1.1 400"},
+        {"another path", "NOTIFY /0" + szGood.substr(szGood.find(' ', 7)), "HTTP/1.1 404"},
+        {"no HTTP", "\r\n\r\n", "HTTP/1.1 400"},
+        {"headers without end", "NOTIFY / HTTP/1.1\r\nA: " + std::string(9000, 'x'), "HTTP/1.1 400"},
+        {"a body without end", Notice(1, std::string(9000, 'x') + kCount), "HTTP/1.1 400"},
+        {"cut short", szGood.substr(0, szGood.size() - 1), "-"}};
+    for (const Case& one : rgCases) {
+        std::string szAnswer;
+        EXPECT_FALSE(IsNews(one.szText, &szAnswer)) << one.szWhat;
+        EXPECT_EQ(szAnswer, one.szAnswer) << one.szWhat;
+    }
+    const tavo::Descriptor fdNeighbour = Connect(kNeighbour);
+    Send(fdNeighbour, szGood);
+    EXPECT_FALSE(mEvents.TakeNews());
+    EXPECT_EQ(Answer(fdNeighbour), "") << "closed, and not a word";
+    EXPECT_TRUE(IsNews(szGood)) << "the same from the router";
+}
+
+TEST_F(EventsTest, SlowOnesHoldNobodyUp) {
+    Subscribe();
+    const std::string szNotice = Notice(0, kState);
+    std::vector<tavo::Descriptor> rgStalled;
+    for (int i = 0; i < 40; ++i) {
+        rgStalled.push_back(Connect(i % 2 == 0 ? kRouter : kNeighbour));
+        Send(rgStalled.back(), szNotice.substr(0, 30));
+        const auto start = std::chrono::steady_clock::now();
+        EXPECT_FALSE(mEvents.TakeNews());
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 1s);
+        EXPECT_LE(mEvents.Fds().size(), 5U) << "a few, however many come";
+    }
+    EXPECT_FALSE(IsNews(szNotice));
+    const tavo::Descriptor fd = Connect();
+    const std::string szNews = Notice(1, kCount);
+    for (size_t i = 0; i < szNews.size(); ++i) {  // byte by byte
+        EXPECT_EQ(Answer(fd), "-");
+        Send(fd, szNews.substr(i, 1));
+        EXPECT_EQ(mEvents.TakeNews(), i + 1 == szNews.size());
+    }
+    EXPECT_EQ(Answer(fd), kOk);
+}
+
+// One request, read to the end of its headers, and its answer; the connection stays open until the next one or the end.
+class WebServer {
+public:
+    explicit WebServer(std::string szAnswer) : mSzAnswer(std::move(szAnswer)) {
+        sockaddr_in own = {};
+        own.sin_family = AF_INET;
+        inet_pton(AF_INET, kRouter, &own.sin_addr);
+        socklen_t nLength = sizeof(own);
+        EXPECT_EQ(bind(mFd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength), 0);
+        EXPECT_EQ(listen(mFd.Get(), 1), 0);
+        EXPECT_EQ(getsockname(mFd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength), 0);
+        mNPort = ntohs(own.sin_port);
+        mThread = std::thread([this] { Serve(); });
+    }
+    ~WebServer() { Request(); }
+    int Port() const { return mNPort; }
+    std::string Request() {
+        if (mThread.joinable()) {
+            mThread.join();
+        }
+        return mSzRequest;
+    }
+
+private:
+    void Serve() {
+        mFdClient.Reset(accept(mFd.Get(), nullptr, nullptr));
+        char szText[1000];
+        while (mSzRequest.find("\r\n\r\n") == std::string::npos) {
+            const ssize_t nRead = recv(mFdClient.Get(), szText, sizeof(szText), 0);
+            if (nRead <= 0) {
+                return;
+            }
+            mSzRequest.append(szText, static_cast<size_t>(nRead));
+        }
+        send(mFdClient.Get(), mSzAnswer.data(), mSzAnswer.size(), MSG_NOSIGNAL);
+    }
+
+    std::string mSzAnswer;
+    std::string mSzRequest;
+    int mNPort = 0;
+    tavo::Descriptor mFd{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    tavo::Descriptor mFdClient;
+    std::thread mThread;
+};
+
+TEST(HttpClient, AsksByAnyMethodAndReadsTheHeaders) {
+    WebServer server("HTTP/1.1 200 OK\r\nSID:  uuid:1 \r\nTimeout: Second-7\r\n\r\n");  // and no end of the body
+    const auto start = std::chrono::steady_clock::now();
+    const tavo::HttpAnswer answer =
+        tavo::HttpClient().Ask("SUBSCRIBE", {kRouter, server.Port(), "/evt?a=b"}, {"NT: upnp:event"});
+    EXPECT_LT(std::chrono::steady_clock::now() - start, 2s) << "the body is not waited for";
+    EXPECT_EQ(answer.enEnd, HttpEnd::kAnswered);
+    EXPECT_EQ(answer.nCode, 200);
+    EXPECT_EQ(answer.headers.Find("sid"), "uuid:1");
+    EXPECT_EQ(answer.headers.Find("TIMEOUT"), "Second-7");
+    EXPECT_TRUE(server.Request().starts_with("SUBSCRIBE /evt?a=b HTTP/1.1\r\n")) << server.Request();
+    EXPECT_NE(server.Request().find("\r\nNT: upnp:event\r\n"), std::string::npos);
+}
+
+TEST(HttpClient, HeadersWithoutEndAreGarbage) {
+    std::string szAnswer = "HTTP/1.1 200 OK\r\n";
+    for (int i = 0; i < 2000; ++i) {
+        szAnswer += "Set-Cookie: " + std::string(30, 'x') + "\r\n";
+    }
+    WebServer server(szAnswer);
+    EXPECT_EQ(tavo::HttpClient().Get({kRouter, server.Port(), "/"}).enEnd, HttpEnd::kGarbage);
+}
+
+}  // namespace
