@@ -2,12 +2,6 @@
 // Promises: see NatpmpMapper.h.
 #include "programs/natpmpd/NatpmpMapper.h"
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-
-#include <cerrno>
-#include <cstring>
 #include <string_view>
 #include <utility>
 
@@ -25,10 +19,6 @@ constexpr DaemonNames kNames{"natpmpd",
                              "/var/run/natpmpd.pid",
                              "/var/run/natpmpd.lock",
                              "/var/tmp/natpmp_portmap.remap"};
-constexpr uint16_t kAnnouncementPort = 5350;
-constexpr size_t kAnnouncementSize = 12;
-constexpr uint8_t kAddressAnswer[] = {0, 128, 0, 0};  // version, opcode, result
-constexpr int kAnnouncementsAtOnce = 64;              // of a flood, no more than these are looked at in one go
 
 // Of words that both daemons use, what they mean here.
 constexpr std::pair<std::string_view, const char*> kCommonWords[] = {
@@ -52,25 +42,9 @@ RouterState StateOf(Reply enReply) {
     }
 }
 
-// Hosts are members of their all-hosts group without asking.
-Descriptor ListenForAnnouncements() {
-    Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-    const int nOn = 1;
-    setsockopt(fd.Get(), SOL_SOCKET, SO_REUSEADDR, &nOn, sizeof(nOn));
-    sockaddr_in group = {};
-    group.sin_family = AF_INET;
-    group.sin_port = htons(kAnnouncementPort);
-    group.sin_addr.s_addr = htonl(INADDR_ALLHOSTS_GROUP);
-    if (bind(fd.Get(), reinterpret_cast<sockaddr*>(&group), sizeof(group)) != 0) {
-        SysLog(LOG_WARNING, "a router that restarts is noticed at the next check only: %s", std::strerror(errno));
-        return Descriptor();
-    }
-    return fd;
-}
-
 }  // namespace
 
-NatpmpMapper::NatpmpMapper() : RuleMapper(kNames), mFdAnnouncements(ListenForAnnouncements()), mMade(kMadeFile) {}
+NatpmpMapper::NatpmpMapper() : RuleMapper(kNames), mMade(kMadeFile) {}
 
 // What was made here before is as doubtful as what was read from the file.
 void NatpmpMapper::NewGateway() {
@@ -83,21 +57,8 @@ void NatpmpMapper::NewGateway() {
 bool NatpmpMapper::OnWake() {
     bool blRestart = RuleMapper::OnWake();
     mBlDoubtful = mBlDoubtful || blRestart;  // its clock may not show it
-    uint8_t rgBytes[kAnnouncementSize];
-    sockaddr_in sender = {};
-    socklen_t nLength = sizeof(sender);
-    for (int i = 0; i < kAnnouncementsAtOnce; ++i) {
-        const ssize_t nSize = recvfrom(mFdAnnouncements.Get(), rgBytes, sizeof(rgBytes), 0,
-                                       reinterpret_cast<sockaddr*>(&sender), &nLength);
-        if (nSize < 0) {
-            break;
-        }
-        if (nSize == sizeof(rgBytes) && Gateway() == inet_ntoa(sender.sin_addr) &&
-            std::memcmp(rgBytes, kAddressAnswer, sizeof(kAddressAnswer)) == 0) {
-            uint32_t nEpoch = 0;
-            std::memcpy(&nEpoch, rgBytes + sizeof(kAddressAnswer), sizeof(nEpoch));
-            blRestart = blRestart || (mPEpoch != nullptr && mPEpoch->IsRestart(ntohl(nEpoch), BootClock::now()));
-        }
+    for (const GatewayAnnouncement& said : mAnnounced.Take(Gateway())) {
+        blRestart = blRestart || (mPEpoch != nullptr && mPEpoch->IsRestart(said.nEpoch, BootClock::now()));
     }
     return blRestart;
 }

@@ -6,11 +6,11 @@
 #include <map>
 #include <string>
 
-#include "ground/Descriptor.h"
 #include "mapping/Carry.h"
 #include "programs/common/MadeFile.h"
 #include "programs/common/RuleMapper.h"
 #include "programs/natpmpd/EpochWatch.h"
+#include "wire/pcp/Announcements.h"
 
 namespace tavo {
 
@@ -19,7 +19,7 @@ public:
     NatpmpMapper();
     std::vector<int> WakeFds() const override {
         std::vector<int> rgFds = RuleMapper::WakeFds();
-        rgFds.push_back(mFdAnnouncements.Get());
+        rgFds.push_back(mAnnounced.Fd());
         return rgFds;
     }
     bool OnWake() override;
@@ -33,7 +33,7 @@ private:
 
     void Forget(bool blRequested);
 
-    Descriptor mFdAnnouncements;
+    GatewayAnnouncements mAnnounced;
     MadeFile mMade;
     Habits mHabit;
     BootClock::time_point mAskedElsewhere;         // since then, mHabit.mapElsewhere has grown

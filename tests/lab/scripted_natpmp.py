@@ -1,7 +1,7 @@
 """A NAT-PMP gateway with faults on the LAN address. Usage: scripted_natpmp.py FAULT [CODE].
 
-Keeps its table and its counters as JSON in STATE. SIGUSR1 is a reboot that it announces, SIGUSR2 one that
-it does not.
+Keeps its table and its counters as JSON in STATE. SIGUSR1 is a reboot that it announces (with the
+fault "pcp" by PCP alone), SIGUSR2 one that it does not.
 """
 import json
 import os
@@ -64,7 +64,9 @@ def reboot(number, _):
     TABLE.clear()
     START = time.monotonic()
     keep("boot")
-    if number == signal.SIGUSR1:
+    if number == signal.SIGUSR1 and FAULT == "pcp":
+        SOCK.sendto(struct.pack("!BBBBII12x", 2, 0x80, 0, 0, 0, 0), ("224.0.0.1", 5350))
+    elif number == signal.SIGUSR1:
         SOCK.sendto(head(0) + socket.inet_aton("198.41.0.4"), ("224.0.0.1", 5350))
 
 

@@ -146,8 +146,8 @@ class FaultyGateway(unittest.TestCase):
                 self.assertTrue(self.state()["count"].get("opcode 0") or fault == "closed", "the fault was reached")
 
     def test_reboots_restore_everything(self):
-        for how, check in ((signal.SIGUSR1, 120), (signal.SIGUSR2, 1)):
-            with self.subTest(how=how), self.gateway("none", check) as gateway:
+        for fault, how, check in (("none", signal.SIGUSR1, 120), ("pcp", signal.SIGUSR1, 120), ("none", signal.SIGUSR2, 1)):
+            with self.subTest(fault=fault, how=how), self.gateway(fault, check) as gateway:
                 LAB.save("1,1,tcp,5001,5001", "2,1,udp,5002,5002")
                 gateway.send_signal(how)
                 wait_for(lambda: self.state()["count"].get("boot"), 5, "the reboot")
