@@ -2,6 +2,8 @@
 // Promises: see RuleMapper.h.
 #include "programs/upnpd/UpnpMapper.h"
 
+#include <algorithm>
+#include <chrono>
 #include <set>
 #include <utility>
 
@@ -19,6 +21,7 @@ constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
 constexpr char kNoIgd[] = "noigd";
 constexpr int kDiscoveryMilliseconds = 8000;
 constexpr int kOutsideMilliseconds = 2000;
+constexpr auto kEcho = std::chrono::seconds(3);  // until what we have changed has been told to us
 
 }  // namespace
 
@@ -26,6 +29,7 @@ UpnpMapper::UpnpMapper() : RuleMapper(kNames), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();
+    mEvents.TurnTo(std::nullopt, "");
     KnownRouter known = RecallRouter(Gateway());
     mSzLocation = std::move(known.szLocation);
     mHabit.blPermanentOnly = known.blPermanentOnly;
@@ -41,6 +45,7 @@ bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
         mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation, 0, fnStop);
         if (mPIgd != nullptr) {
+            mEvents.TurnTo(mPIgd->Service().events, Box());
             Remember();
         }
     }
@@ -69,6 +74,28 @@ void UpnpMapper::NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassRe
     }
 }
 
+// Before the table is read: what changes after that is told.
+void UpnpMapper::KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
+    if (rgWanted.empty()) {
+        mEvents.End();
+    } else {
+        mEvents.Keep(BootClock::now(), fnStop);
+    }
+}
+
+std::vector<int> UpnpMapper::WakeFds() const {
+    std::vector<int> rgFds = RuleMapper::WakeFds();
+    for (const int fd : mEvents.Fds()) {
+        rgFds.push_back(fd);
+    }
+    return rgFds;
+}
+
+bool UpnpMapper::OnWake() {
+    const bool blRouter = RuleMapper::OnWake();
+    return (mEvents.TakeNews() && BootClock::now() >= mQuietUntil) || blRouter;
+}
+
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     if (!FindRouter(fnStop)) {
         PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
@@ -85,8 +112,16 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     const bool blPermanentOnly = mHabit.blPermanentOnly;
+    KeepEvents(rgWanted, fnStop);
     IgdRouter router(*mPIgd);
-    PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, Around(fnStop, mMade));
+    bool blChanged = false;
+    Surroundings around = Around(fnStop, mMade);
+    around.fnTell = [&blChanged, fnLog = around.fnTell](const RouterMapping& mapping, const Step& step) {
+        blChanged = true;
+        fnLog(mapping, step);
+    };
+    PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);
+    mQuietUntil = blChanged ? BootClock::now() + kEcho : mQuietUntil;
     result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;
     if (blPermanentOnly != mHabit.blPermanentOnly) {
         Remember();
@@ -101,7 +136,12 @@ PassResult UpnpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool /*bl
     // A router that restarted often has its service at another port: look for it at once.
     if (result.transport.enReply == Reply::kUnreachable && mPIgd != nullptr && !result.blStopped) {
         LostRouter();
-        return MapOnce(rgWanted, fnStop);
+        result = MapOnce(rgWanted, fnStop);
+    }
+    if (const auto due = mEvents.Due()) {
+        const auto left = std::chrono::ceil<std::chrono::seconds>(*due - BootClock::now()).count();
+        const int nLeft = static_cast<int>(std::clamp<int64_t>(left, 1, INT32_MAX));
+        result.nNextSeconds = result.nNextSeconds == 0 ? nLeft : std::min(result.nNextSeconds, nLeft);
     }
     return result;
 }

@@ -4,10 +4,12 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "mapping/Carry.h"
 #include "programs/common/MadeFile.h"
 #include "programs/common/RuleMapper.h"
+#include "wire/upnp/Events.h"
 #include "wire/upnp/Igd.h"
 
 namespace tavo {
@@ -15,6 +17,9 @@ namespace tavo {
 class UpnpMapper : public RuleMapper {
 public:
     UpnpMapper();
+    std::vector<int> WakeFds() const override;
+    // The router has told that its table has changed, too.
+    bool OnWake() override;
 
 private:
     PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
@@ -27,12 +32,15 @@ private:
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
     void NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result);
+    void KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     std::string mSzLocation;
     std::unique_ptr<Igd> mPIgd;
     Habits mHabit;
     MadeFile mMade;
+    Events mEvents;
+    BootClock::time_point mQuietUntil;  // before then, what the router tells of its table is our own doing
 };
 
 }  // namespace tavo

@@ -62,6 +62,28 @@ class World(unittest.TestCase):
         LAB.start_router()
         wait_for(lambda: LAB.reaches("tcp", 5001), 10, "it is open again")
 
+    def test_an_entry_that_somebody_takes_away_is_back_at_once(self):
+        """The router tells; nobody else can."""
+        LAB.settings(check_interval=3600)
+        LAB.start_router(secure=False)
+        state = lambda: json.loads(LAB.read(PUBLISHED))
+        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
+        wait_for(lambda: state()["next_look"] - time.time() > 25, 60, "peace")
+        quiet = state()
+        listener = next(line.split()[3] for line in LAB.run("box", "ss -Hltnp").stdout.splitlines() if '"upnpd"' in line)
+        self.assertTrue(listener.startswith(BOX + ":"), "nothing is heard elsewhere")
+        answer = LAB.run("lan2", "curl -s -m 3 -X NOTIFY -H 'SID: uuid:1' -H 'SEQ: 1' -d '<PortMappingNumberOfEntries>0"
+                         f"</PortMappingNumberOfEntries>' http://{listener}/", check=False)
+        self.assertNotEqual(answer.returncode, 0)
+        self.assertEqual(answer.stdout, "", "a neighbour gets no word")
+        time.sleep(7)
+        self.assertEqual(state(), quiet, "and wakes nobody")
+        LAB.run("lan2", "upnpc -d 5001 tcp")
+        wait_for(lambda: LAB.mappings() == {("tcp", 5001): (BOX, 5001)}, 10, "it is open again")
+        self.assertLess(time.time(), quiet["next_look"] - 3, "before it would have looked")
+        LAB.stop_daemon(signal.SIGTERM)
+        self.assertEqual(LAB.mappings(), {})
+
     def test_the_box_has_another_address_by_natpmp(self):
         """A gateway knows a client by its address: the old mapping lasts until its lease ends, and is named till then."""
         LAB.install(natpmp=True)

@@ -57,6 +57,18 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_EQ(fnControl("/c", "<URLBase>http://10.0.0.9/</URLBase>"), "http://192.168.1.1:80/c");
     EXPECT_EQ(fnControl("http://10.0.0.9/c", ""), "");
     EXPECT_EQ(fnControl("", ""), "");
+    const auto fnEvents = [&](const std::string& szElement) {
+        const auto service = tavo::ParseDescription(
+            "<root><service><serviceType>urn:schemas-upnp-org:service:"
+            "WANIPConnection:1</serviceType><controlURL>/c</controlURL>" +
+                szElement + "</service></root>",
+            location);
+        return service && service->events ? service->events->Text() : "";
+    };
+    EXPECT_EQ(fnEvents("<eventSubURL>evt</eventSubURL>"), "http://192.168.1.1:80/dir/evt");
+    EXPECT_EQ(fnEvents("<eventSubURL>http://10.0.0.9/e</eventSubURL>"), "");
+    EXPECT_EQ(fnEvents("<eventSubURL/>"), "");
+    EXPECT_EQ(fnEvents(""), "");
     std::string szDeep;
     for (int i = 0; i < 5000; ++i) {
         szDeep += "<a>";

@@ -29,6 +29,8 @@ public:
     void Keep(BootClock::time_point now, const std::function<bool()>& fnStop);
     // Ends the subscription, at the router too.
     void End();
+    // When it is to be kept the next time; nothing without a subscription.
+    std::optional<BootClock::time_point> Due() const { return IsSubscribed() ? std::optional(mDue) : std::nullopt; }
     bool IsSubscribed() const { return !mSzSubscription.empty(); }
     // Readable when the router spoke.
     std::vector<int> Fds() const { return mListener.Fds(); }

@@ -128,21 +128,21 @@ IgdModel ReadModel(const XMLElement* pRoot) {
     return model;
 }
 
-// The control address, whole or relative to the description; never on another host.
-std::optional<HttpUrl> ResolveControl(const std::string& szControl, const std::string& szBase,
+// An address of the service, whole or relative to the description; never on another host.
+std::optional<HttpUrl> ResolveAddress(const std::string& szAddress, const std::string& szBase,
                                       const HttpUrl& location) {
-    if (szControl.starts_with("http://")) {
-        const auto url = ParseHttpUrl(szControl);
+    if (szAddress.starts_with("http://")) {
+        const auto url = ParseHttpUrl(szAddress);
         return url && url->szHost == location.szHost ? url : std::nullopt;
     }
     HttpUrl url = location;
     if (const auto base = ParseHttpUrl(szBase); base && base->szHost == location.szHost) {
         url = *base;
     }
-    if (szControl.empty()) {
+    if (szAddress.empty()) {
         return std::nullopt;
     }
-    url.szPath = szControl.starts_with("/") ? szControl : url.szPath.substr(0, url.szPath.rfind('/') + 1) + szControl;
+    url.szPath = szAddress.starts_with("/") ? szAddress : url.szPath.substr(0, url.szPath.rfind('/') + 1) + szAddress;
     return ParseHttpUrl(url.Text());
 }
 
@@ -245,11 +245,15 @@ std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpU
     }
     const std::string szBase =
         TextOf(FindElement(document.RootElement()->FirstChildElement(), "URLBase", kMaxDepth - 1));
-    const auto control = ResolveControl(TextOf(pService->FirstChildElement("controlURL")), szBase, location);
+    const auto fnResolve = [&](const char* szName) {
+        return ResolveAddress(TextOf(pService->FirstChildElement(szName)), szBase, location);
+    };
+    const auto control = fnResolve("controlURL");
     if (!control) {
         return std::nullopt;
     }
-    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control, ReadModel(document.RootElement())};
+    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control, fnResolve("eventSubURL"),
+                      ReadModel(document.RootElement())};
 }
 
 int SoapCode(long nHttpCode, const std::string& szXml) {

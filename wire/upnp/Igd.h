@@ -46,6 +46,7 @@ inline constexpr size_t kMaxModelText = 63;
 struct IgdService {
     std::string szType;
     HttpUrl control;
+    std::optional<HttpUrl> events;  // where it takes subscriptions; nothing where it tells nothing
     IgdModel model;
 };
 // Nothing when the description is unreadable, offers none, or sends us to another host.
