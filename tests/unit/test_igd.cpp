@@ -3,9 +3,11 @@
 
 #include <tuple>
 
+#include "wire/upnp/Description.h"
 #include "wire/upnp/Igd.h"
 #include "wire/upnp/Notify.h"
 #include "wire/upnp/Search.h"
+#include "wire/upnp/Soap.h"
 
 namespace {
 
@@ -111,14 +113,21 @@ TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
 }
 
 TEST(Igd, AnswersThatAreNoneAreGarbage) {
-    EXPECT_EQ(tavo::SoapCode(200, "<e><Body><r/></Body></e>"), tavo::kWireOk);
-    EXPECT_EQ(tavo::SoapCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);
+    const auto fnCode = [](long nHttpCode, const std::string& szXml) {
+        return tavo::SoapAnswer({tavo::HttpEnd::kAnswered, nHttpCode, szXml}).Code();
+    };
+    EXPECT_EQ(fnCode(200, "<e><Body><r/></Body></e>"), tavo::kWireOk);
+    EXPECT_EQ(fnCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);
     for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>",
                               "<e><Body><Fault><errorCode>1</errorCode></Fault></Body></e>",
                               "<e><Body><Fault><errorCode>0</errorCode></Fault></Body></e>"}) {
-        EXPECT_EQ(tavo::SoapCode(200, szXml), tavo::kWireGarbage) << szXml;
+        EXPECT_EQ(fnCode(200, szXml), tavo::kWireGarbage) << szXml;
     }
-    EXPECT_EQ(tavo::SoapCode(404, "<e><Body><r/></Body></e>"), tavo::kWireGarbage);
+    EXPECT_EQ(fnCode(404, "<e><Body><r/></Body></e>"), tavo::kWireGarbage);
+    const std::string szGood = "<e><Body><r/></Body></e>";
+    EXPECT_EQ(tavo::SoapAnswer({tavo::HttpEnd::kTimeout, 200, szGood}).Code(), tavo::kWireTimeout);
+    EXPECT_EQ(tavo::SoapAnswer({tavo::HttpEnd::kUnreachable, 200, szGood}).Code(), tavo::kWireUnreachable);
+    EXPECT_EQ(tavo::SoapAnswer({tavo::HttpEnd::kGarbage, 200, szGood}).Code(), tavo::kWireGarbage);
 }
 
 // A router whose answers are given beforehand.
@@ -129,14 +138,31 @@ public:
                 "<root><device><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:" + mSzVersion +
                     "</serviceType><controlURL>/c</controlURL></service></device></root>"};
     }
-    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string&) override {
+    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string& szBody) override {
         ++mNPosts;
+        mSzAsked = szBody;
         return {tavo::HttpEnd::kAnswered, 200, "<e><Body><r>" + mSzAnswer + "</r></Body></e>"};
     }
     std::string mSzVersion = "2";
     std::string mSzAnswer;
+    std::string mSzAsked;
     int mNPosts = 0;
 };
+
+TEST(Igd, WhatIsAskedIsXmlWhateverATextHolds) {
+    const auto pRouter = std::make_shared<Canned>();
+    const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pRouter);
+    ASSERT_NE(pIgd, nullptr);
+    tavo::IgdEntry entry{"TCP", 5001, 8080, "192.168.1.5", "a</NewEnabled>&\"b'", 60, true};
+    EXPECT_EQ(pIgd->Add(entry), tavo::kWireOk);
+    for (const char* szPart : {"<u:AddPortMapping xmlns:u=\"urn:schemas-upnp-org:service:WANIPConnection:2\">",
+                               "<NewRemoteHost></NewRemoteHost><NewExternalPort>5001</NewExternalPort>",
+                               "<NewInternalPort>8080</NewInternalPort>", "<NewLeaseDuration>60</NewLeaseDuration>",
+                               "<NewPortMappingDescription>a&lt;/NewEnabled&gt;&amp;\"b'</NewPortMappingDescription>",
+                               "</u:AddPortMapping></s:Body></s:Envelope>"}) {
+        EXPECT_NE(pRouter->mSzAsked.find(szPart), std::string::npos) << szPart << " in " << pRouter->mSzAsked;
+    }
+}
 
 TEST(Igd, ARangeShowsWhatMakesSense) {
     const auto fnEntry = [](const char* szPort, const char* szClient) {

@@ -1,16 +1,20 @@
 // An Internet Gateway Device: its port-mapping service, found and spoken to.
-// Relies on Ssdp and Http; tinyxml2 reads what the router sends.
+// Relies on Search, Description and Soap.
 // Promises: only the gateway is ever contacted; every answer is bounded; texts are printable.
 #pragma once
 
 #include <memory>
-#include <optional>
 #include <string>
+#include <vector>
 
 #include "wire/Answer.h"
 #include "wire/http/Http.h"
+#include "wire/upnp/Description.h"
 
 namespace tavo {
+
+class SoapAnswer;
+struct SoapArgument;
 
 // An entry of the router's table.
 struct IgdEntry {
@@ -32,28 +36,6 @@ enum IgdCode : int {
     kIgdConflict = 718,
     kIgdOnlyPermanentLeases = 725
 };
-
-// What a router says it is, in its root device. A text that is too long keeps its beginning and gets a
-// mark of the whole at its end, so that two routers never become one.
-struct IgdModel {
-    std::string szBrand;
-    std::string szModel;
-    std::string szVersion;  // the firmware's where the router gives one, else the model number
-};
-inline constexpr size_t kMaxModelText = 63;
-
-// The service of a device description that maps ports.
-struct IgdService {
-    std::string szType;
-    HttpUrl control;
-    std::optional<HttpUrl> events;  // where it takes subscriptions; nothing where it tells nothing
-    IgdModel model;
-};
-// Nothing when the description is unreadable, offers none, or sends us to another host.
-std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
-
-// The error code of a SOAP answer (0 for none), or kWireGarbage.
-int SoapCode(long nHttpCode, const std::string& szXml);
 
 // Every call answers a WireCode, or the protocol's own code. Outputs are set only with kWireOk; with kWireTooLong,
 // List() has what was read.
@@ -88,13 +70,9 @@ public:
     const IgdService& Service() const { return mService; }
 
 private:
-    struct Argument {
-        const char* szName;
-        std::string szValue;
-    };
     Igd(IgdService service, std::shared_ptr<HttpTransport> pHttp)
         : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")), mPHttp(std::move(pHttp)) {}
-    int Call(const char* szAction, const std::vector<Argument>& rgArguments, std::string& szAnswer);
+    SoapAnswer Call(const char* szAction, const std::vector<SoapArgument>& rgArguments);
 
     IgdService mService;
     bool mBlRanges;  // services of the second generation show ranges, unless they once could not

@@ -1,0 +1,126 @@
+// See Description.h.
+#include "wire/upnp/Description.h"
+
+#include <cstdint>
+#include <cstdio>
+
+#include "ground/TextFile.h"
+#include "wire/upnp/Xml.h"
+
+namespace tavo {
+
+namespace {
+
+using tinyxml2::XMLElement;
+
+// A mark of a text that is too long to be kept (32-bit FNV-1a).
+std::string MarkOf(std::string_view szText) {
+    uint32_t nHash = 2166136261U;
+    for (const char c : szText) {
+        nHash = (nHash ^ static_cast<unsigned char>(c)) * 16777619U;
+    }
+    char szMark[16];
+    std::snprintf(szMark, sizeof(szMark), "~%08x", nHash);
+    return szMark;
+}
+
+bool IsInsideCharacter(char c) {
+    return (static_cast<unsigned char>(c) & 0xC0U) == 0x80U;
+}
+
+// One text of what the router says it is.
+std::string ModelText(const XMLElement* pDevice, std::string_view szName) {
+    const XMLElement* pElement = pDevice->FirstChildElement();
+    while (pElement != nullptr && LocalName(*pElement) != szName) {
+        pElement = pElement->NextSiblingElement();
+    }
+    const char* szRaw = pElement == nullptr ? nullptr : pElement->GetText();
+    std::string szText(szRaw == nullptr ? "" : szRaw);
+    szText = Trim(PrintableText(szText, szText.size()));
+    if (szText.size() > kMaxModelText) {
+        const std::string szMark = MarkOf(szText);
+        size_t nKeep = kMaxModelText - szMark.size();
+        while (nKeep > 0 && IsInsideCharacter(szText[nKeep])) {
+            --nKeep;
+        }
+        szText = szText.substr(0, nKeep) + szMark;
+    }
+    return szText;
+}
+
+bool MapsPorts(const std::string& szType) {
+    return szType.starts_with("urn:schemas-upnp-org:service:WANIPConnection:") ||
+           szType.starts_with("urn:schemas-upnp-org:service:WANPPPConnection:");
+}
+
+// The first service below pElement that maps ports.
+const XMLElement* FindService(const XMLElement* pElement, int nDepth = 0) {
+    for (; pElement != nullptr && nDepth < kMaxXmlDepth; pElement = pElement->NextSiblingElement()) {
+        if (LocalName(*pElement) == "service" && MapsPorts(TextOf(pElement->FirstChildElement("serviceType")))) {
+            return pElement;
+        }
+        if (const XMLElement* pFound = FindService(pElement->FirstChildElement(), nDepth + 1)) {
+            return pFound;
+        }
+    }
+    return nullptr;
+}
+
+IgdModel ReadModel(const XMLElement* pRoot) {
+    const XMLElement* pDevice = FindElement(pRoot, "device");
+    if (pDevice == nullptr) {
+        return {};
+    }
+    IgdModel model{ModelText(pDevice, "manufacturer"), ModelText(pDevice, "modelName"), ""};
+    // The first two are no standard elements; the routers that have them keep the number for the model.
+    for (const char* szName : {"firmwareVersion", "softwareVersion", "modelNumber"}) {
+        if (model.szVersion.empty()) {
+            model.szVersion = ModelText(pDevice, szName);
+        }
+    }
+    return model;
+}
+
+// An address of the service, whole or relative to the description; never on another host.
+std::optional<HttpUrl> ResolveAddress(const std::string& szAddress, const std::string& szBase,
+                                      const HttpUrl& location) {
+    if (szAddress.starts_with("http://")) {
+        const auto url = ParseHttpUrl(szAddress);
+        return url && url->szHost == location.szHost ? url : std::nullopt;
+    }
+    HttpUrl url = location;
+    if (const auto base = ParseHttpUrl(szBase); base && base->szHost == location.szHost) {
+        url = *base;
+    }
+    if (szAddress.empty()) {
+        return std::nullopt;
+    }
+    url.szPath = szAddress.starts_with("/") ? szAddress : url.szPath.substr(0, url.szPath.rfind('/') + 1) + szAddress;
+    return ParseHttpUrl(url.Text());
+}
+
+}  // namespace
+
+std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location) {
+    tinyxml2::XMLDocument document;
+    if (document.Parse(szXml.data(), szXml.size()) != tinyxml2::XML_SUCCESS) {
+        return std::nullopt;
+    }
+    const XMLElement* pService = FindService(document.RootElement());
+    if (pService == nullptr) {
+        return std::nullopt;
+    }
+    const std::string szBase =
+        TextOf(FindElement(document.RootElement()->FirstChildElement(), "URLBase", kMaxXmlDepth - 1));
+    const auto fnResolve = [&](const char* szName) {
+        return ResolveAddress(TextOf(pService->FirstChildElement(szName)), szBase, location);
+    };
+    const auto control = fnResolve("controlURL");
+    if (!control) {
+        return std::nullopt;
+    }
+    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control, fnResolve("eventSubURL"),
+                      ReadModel(document.RootElement())};
+}
+
+}  // namespace tavo
