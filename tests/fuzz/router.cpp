@@ -168,8 +168,8 @@ void Map(tavo::Igd& igd) {
     Watched router(igd);
     tavo::Habits habit;
     tavo::Record record("", "boot");
-    const tavo::PassResult result =
-        tavo::BringInLine(router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] { return true; }});
+    const tavo::PassResult result = tavo::BringInLine(
+        router, rgWanted, record, habit, {kBox, tavo::BootSeconds, [] { return false; }, [] { return true; }});
     Require(result.rgOutcomes.size() >= rgWanted.size(), "every mapping has a status");
     for (size_t i = 0; i < result.rgOutcomes.size(); ++i) {
         const std::string& szStatus = result.rgOutcomes[i].verdict.szWord;

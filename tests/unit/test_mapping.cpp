@@ -110,8 +110,9 @@ std::vector<std::string> Texts(const tavo::PassResult& result) {
 struct Core {
     tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted) {
         record.TurnTo({"192.168.1.1", ""});
-        return tavo::BringInLine(router, rgWanted, record, habit,
-                                 {kBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0; }});
+        return tavo::BringInLine(
+            router, rgWanted, record, habit,
+            {kBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0; }});
     }
     tavo::Record record{"", "boot"};
     tavo::Habits habit;
@@ -328,9 +329,9 @@ TEST(Mapping, AStopInTheMiddleLosesNothing) {
     tavo::Record record("", "boot");
     tavo::Habits habit;
     record.TurnTo({"192.168.1.1", ""});
-    const auto result =
-        tavo::BringInLine(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
-                          {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] { return true; }});
+    const auto result = tavo::BringInLine(
+        router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
+        {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] { return true; }});
     EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
     EXPECT_TRUE(record.Here().contains({"TCP", 1}));
 }

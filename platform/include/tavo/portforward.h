@@ -17,7 +17,7 @@ extern "C" {
 
 enum {
     TAVO_PF_NAME_SIZE = 1024,
-    TAVO_PF_PORTS_SIZE = 1024, /* of a list of ports in the library's records, with the NUL */
+    TAVO_PF_PORTS_SIZE = 1024,   /* of a list of ports in the library's records, with the NUL */
     TAVO_PF_MAX_SECTIONS = 16384 /* of a file: a node has a kilobyte, and one of nothing but "[]" must not eat it all */
 };
 

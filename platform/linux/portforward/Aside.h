@@ -9,7 +9,8 @@ namespace tavo {
 // Where the file is missing, because a writer was killed in between, the newest copy takes its place again; for
 // router.conf also router.conf.bak. Nothing is
 // replaced, but for what a report that was killed put in the place of the settings: they come back from the name and
-// a suffix that begins with a digit, unless somebody has changed router.conf since. False: there is a copy, and it is left to its owner, who lives.
+// a suffix that begins with a digit, unless somebody has changed router.conf since. False: there is a copy, and it is
+// left to its owner, who lives.
 bool BringBack(const char* szPath);
 // Only what a killed report set aside, and only of router.conf; any other path is left alone. For whoever is about to
 // write as well: he must not take what a killed writer left for the live file.
