@@ -87,6 +87,9 @@ bool RuleMapper::FindGateway() {
     if (!blFound) {
         szGateway[0] = '\0';
     }
+    if (mSzGateway != szGateway) {
+        mSzHardware.clear();
+    }
     if (mSzGateway != szGateway || mSzBox != szBox) {
         mSzGateway = szGateway;
         mSzBox = szBox;
@@ -120,6 +123,17 @@ Surroundings RuleMapper::Around(const std::function<bool()>& fnStop, MadeFile& m
                        blOpened ? "is to lead to" : "no longer leads to", mapping.szClient.c_str(),
                        static_cast<unsigned>(mapping.nBoxPort), step.szWhy);
             }};
+}
+
+RouterName RuleMapper::Front(const std::function<bool()>& fnStop) {
+    std::string szHardware = HardwareAddress(mSzGateway);
+    if (szHardware.empty() && IsNeighbourThere(mSzGateway, fnStop)) {
+        szHardware = HardwareAddress(mSzGateway);
+    }
+    if (!szHardware.empty()) {
+        mSzHardware = szHardware;
+    }
+    return {mSzGateway, mSzHardware};
 }
 
 PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const char* szWord, RouterState enRouter) {

@@ -57,6 +57,9 @@ protected:
 
     const std::string& Gateway() const { return mSzGateway; }
     const std::string& Box() const { return mSzBox; }
+    // The router in front. The kernel forgets hardware, as when the cable was out; at one address it is asked for it, or
+    // else the same as before.
+    RouterName Front(const std::function<bool()>& fnStop);
     uint32_t WishedLease() const { return mNWishedLease; }
     // What the core needs to know of this box; what it does is logged.
     Surroundings Around(const std::function<bool()>& fnStop, MadeFile& made) const;
@@ -87,6 +90,7 @@ private:
     RouterTurn mTurn;
     std::string mSzGateway;
     std::string mSzBox;
+    std::string mSzHardware;  // of the gateway, as it was last seen
     Keeper mKeeper;
     std::string mSzLast;  // what the last pass had to say
     std::string mSzOutside;

@@ -6,7 +6,6 @@
 #include <utility>
 
 #include "ground/SysLog.h"
-#include "ground/net/Neighbour.h"
 #include "programs/natpmpd/NatpmpRouter.h"
 
 namespace tavo {
@@ -83,7 +82,7 @@ void NatpmpMapper::Forget(bool blRequested) {
 PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                              const std::function<bool()>& fnStop) {
     Record& record = mMade.Get();
-    const RouterName name{Gateway(), HardwareAddress(Gateway())};
+    const RouterName name = Front(fnStop);
     record.TurnTo(name);
     if (mMapEpochs.size() >= kMostRouters) {
         mMapEpochs.clear();

@@ -7,7 +7,6 @@
 #include <set>
 #include <utility>
 
-#include "ground/net/Neighbour.h"
 #include "programs/common/IgdRouter.h"
 #include "wire/upnp/GatewayMemory.h"
 
@@ -59,7 +58,6 @@ void UpnpMapper::Remember() const {
 
 // A router that maps no ports any more may still forward those that we made.
 void UpnpMapper::NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result) {
-    mMade.Get().TurnTo({Gateway(), HardwareAddress(Gateway())});
     std::set<MappingKey> setWanted;
     for (const RouterMapping& wanted : rgWanted) {
         setWanted.insert(KeyOf(wanted));
@@ -98,16 +96,13 @@ bool UpnpMapper::OnWake() {
 
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     if (!FindRouter(fnStop)) {
+        mMade.Get().TurnTo(Front([] { return true; }));  // nobody is there to be asked
         PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
         result.blStopped = fnStop();
         NameLeftOver(rgWanted, result);
         return result;
     }
-    std::string szHardware = HardwareAddress(Gateway());
-    if (szHardware.empty() && IsNeighbourThere(Gateway(), fnStop)) {  // forgotten, as when the cable was out
-        szHardware = HardwareAddress(Gateway());
-    }
-    mMade.Get().TurnTo({Gateway(), szHardware});
+    mMade.Get().TurnTo(Front(fnStop));
     mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
