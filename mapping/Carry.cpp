@@ -10,6 +10,7 @@
 #include <optional>
 #include <utility>
 
+#include "ground/Marks.h"
 #include "mapping/Plan.h"
 
 namespace tavo {
@@ -47,6 +48,13 @@ struct Place {
     Verdict verdict = {};
 };
 
+// What goes on record of a mapping that was asked for at that time.
+Made RowOf(const RouterMapping& mapping, bool blShown, int64_t nAsked) {
+    Made made{mapping.szClient, mapping.nBoxPort, mapping.szDescription, blShown, mapping.nLease, nAsked};
+    made.nMore = mapping.nMore;
+    return made;
+}
+
 class Pass {
 public:
     Pass(Router& router, Record& record, Habits& habit, const Surroundings& around)
@@ -64,7 +72,7 @@ private:
     RouterReply Note(RouterReply reply);
     Made* MadeAt(const MappingKey& key);
     Step StepFor(const MappingKey& key, const Place& place);
-    void Show(const RouterMapping& entry);
+    void Show(const MappingKey& key, const RouterMapping& entry);
     void LookAtTable();
     RouterReply Look(const MappingKey& key, Place& place);
     void Recall();
@@ -83,6 +91,7 @@ private:
     bool Add(const MappingKey& key, Place& place, bool blAnew);
     void OnMade(const MappingKey& key, Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew);
     void OnElsewhere(const MappingKey& key, Place& place, const RouterMapping& made, const RouterReply& reply);
+    void LookAgain(const MappingKey& key);
     uint16_t OlderPlace(const MappingKey& key, uint16_t nBoxPort) const;
     void OnRefused(const MappingKey& key, Place& place, const RouterReply& reply);
     void ShowRanges();
@@ -103,6 +112,7 @@ private:
     const Surroundings& mAround;
     std::map<MappingKey, Place> mMapPlaces;
     std::vector<MappingKey> mRgWritten;  // to be read back
+    RouterReply mApplied;                // whether what was done has taken effect
     PassResult mResult;
     PassGuard mGuard;
     bool mBlSense = false;  // the router has answered at least one question of this pass with sense
@@ -123,20 +133,21 @@ Made* Pass::MadeAt(const MappingKey& key) {
 Step Pass::StepFor(const MappingKey& key, const Place& place) {
     const PlaceView view{place.pWanted, place.enSeen, place.enSeen == Seen::kPresent ? &place.entry : nullptr,
                          MadeAt(key)};
-    Step step = Decide(view, mAround.szBox, mAround.fnNow(), mAbilities.blLeases);
-    if (step.enAction == Action::kChange && !mAbilities.blShows) {
-        step.enAction = Action::kReplace;  // nobody could see what came of it
-    }
-    return step;
+    return Decide(view, mAround.szBox, mAround.fnNow(), mAbilities);
 }
 
 // Takes in what the router shows at a place. What it shows of ours is how we know it from then on.
-void Pass::Show(const RouterMapping& entry) {
-    Place& place = mMapPlaces[KeyOf(entry)];
+void Pass::Show(const MappingKey& key, const RouterMapping& entry) {
+    Place& place = mMapPlaces[key];
     place.enSeen = Seen::kPresent;
     place.entry = entry;
-    Made* pMade = MadeAt(KeyOf(entry));
-    if (pMade == nullptr || !pMade->IsEntry(entry)) {
+    Made* pMade = KeyOf(entry) == key ? MadeAt(key) : nullptr;
+    // Whom it is for where the router does not show that: for whom we made it, unless its text is somebody else's.
+    if (pMade != nullptr && entry.szClient.empty() &&
+        (entry.szDescription.empty() || entry.szDescription.starts_with(kOwnPrefix))) {
+        place.entry.szClient = pMade->szClient;
+    }
+    if (pMade == nullptr || !pMade->IsEntry(place.entry)) {
         return;
     }
     pMade->szText = entry.szDescription;
@@ -155,11 +166,12 @@ void Pass::LookAtTable() {
     std::vector<RouterMapping> rgTable;
     Note(mRouter.List(rgTable));
     for (const RouterMapping& entry : rgTable) {
-        Show(entry);
+        Show(KeyOf(entry), entry);
     }
 }
 
 // A router that shows nothing: what it has granted, and what has not run out since, is what there is while it answers.
+// Where it was not asked for anything, nothing of ours is.
 void Pass::Recall() {
     std::vector<RouterMapping> rgNone;
     if (RouterReply reply = Note(mRouter.List(rgNone)); reply.IsSilence()) {
@@ -168,7 +180,7 @@ void Pass::Recall() {
     for (auto& [key, place] : mMapPlaces) {
         const Made* pMade = MadeAt(key);
         const bool blThere = pMade != nullptr && pMade->blShown && mAround.fnNow() < pMade->End();
-        place.enSeen = blThere ? Seen::kPresent : Seen::kHidden;
+        place.enSeen = blThere ? Seen::kPresent : pMade == nullptr ? Seen::kAbsent : Seen::kHidden;
         if (blThere) {
             place.entry = Known(key, place);
         }
@@ -180,7 +192,7 @@ RouterReply Pass::Look(const MappingKey& key, Place& place) {
     RouterMapping entry;
     RouterReply reply = Note(mRouter.Get(key.first, key.second, entry));
     if (reply.IsOk()) {
-        Show(entry);
+        Show(key, entry);
     } else if (reply.IsRefusal()) {
         place.enSeen = reply.enReply == Reply::kNoSuchEntry ? Seen::kAbsent : Seen::kHidden;
     }
@@ -206,7 +218,9 @@ bool Pass::Remove(const MappingKey& key, Place& place) {
     if (reply.IsOk() || reply.enReply == Reply::kNoSuchEntry) {
         place.enSeen = Seen::kAbsent;
         place.kept = {};
-        mRecord.Here().erase(key);
+        if (!mAbilities.blForm || place.pWanted == nullptr) {  // else it is asked for anew at once, and stays on record
+            mRecord.Here().erase(key);
+        }
         return true;
     }
     place.kept = std::move(reply);
@@ -235,16 +249,18 @@ void Pass::TakeAway(const std::vector<MappingKey>& rgKeys) {
 // Puts on record what the router is about to be asked for at a place. True when that is news.
 bool Pass::Intend(const MappingKey& key, const Place& place) {
     Made* pMade = MadeAt(key);
-    const uint16_t nPort = place.pWanted->nBoxPort;
+    RouterMapping mapping = *place.pWanted;
+    mapping.szClient = mAround.szBox;
+    mapping.nLease = mHabit.blPermanentOnly ? 0 : mHabit.nLease;
     if (pMade != nullptr && place.enSeen == Seen::kPresent) {  // a change: it may lead to the one port or to the other
-        const bool blNews = pMade->blShown || pMade->nOtherPort != nPort;
+        const bool blNews = pMade->blShown || pMade->nOtherPort != mapping.nBoxPort;
         pMade->blShown = false;
-        pMade->nOtherPort = nPort;
+        pMade->nOtherPort = mapping.nBoxPort;
         return blNews;
     }
-    const bool blNews = pMade == nullptr || pMade->szClient != mAround.szBox || pMade->nBoxPort != nPort;
-    const uint32_t nLease = mHabit.blPermanentOnly ? 0 : mHabit.nLease;
-    mRecord.Here()[key] = {mAround.szBox, nPort, place.pWanted->szDescription, false, nLease, mAround.fnNow()};
+    const bool blNews = pMade == nullptr || pMade->szClient != mAround.szBox || pMade->nBoxPort != mapping.nBoxPort ||
+                        pMade->nMore != mapping.nMore;
+    mRecord.Here()[key] = RowOf(mapping, false, mAround.fnNow());
     return blNews;
 }
 
@@ -279,8 +295,8 @@ void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
                 rgBefore.emplace_back(key, std::move(before));
             }
         } else if (enAction == Action::kRenew && MadeAt(key) == nullptr) {  // made before there was a record
-            mRecord.Here()[key] = {
-                mAround.szBox, place.entry.nBoxPort, place.entry.szDescription, true, place.entry.nLease, 0, true};
+            mRecord.Here()[key] = RowOf(place.entry, true, 0);
+            mRecord.Here()[key].blBefore = true;
             blNews = true;
         }
     }
@@ -308,7 +324,7 @@ size_t Pass::Bring(std::vector<MappingKey> rgKeys) {
     }
     for (const MappingKey& key : rgKeys) {
         Settle(key, mMapPlaces[key]);
-        if (mAround.fnNow() - mNReadBack > kReadBackAfter) {
+        if (!mAbilities.blForm && mAround.fnNow() - mNReadBack > kReadBackAfter) {
             ReadBack();
         }
     }
@@ -347,18 +363,22 @@ bool Pass::Do(const MappingKey& key, Place& place, const Step& step) {
             if (place.kept.IsOk() && Remove(key, place)) {
                 return true;
             }
+            if (place.enSeen == Seen::kHidden && Serves(Known(key, place), *place.pWanted, mAround.szBox)) {
+                return Add(key, place, true);  // the answer shows whether it is there
+            }
             place.verdict = StillHeld(key, place.kept);
             return false;
         case Action::kKeep:
             if (MadeAt(key) == nullptr) {  // made before there was a record; its age is not known
-                mRecord.Here()[key] = {mAround.szBox, place.entry.nBoxPort, place.entry.szDescription,
-                                       true,          place.entry.nLease,   mAround.fnNow()};
+                mRecord.Here()[key] = RowOf(place.entry, true, mAround.fnNow());
             }
             place.verdict = Open(key, place);
+            LookAgain(key);
             return false;
         case Action::kLeave:
             place.verdict = {PortState::kOpen, "1", {}, place.entry.nLease, true};
             Wake(place.entry.nLease == 0 ? kNever : mAround.fnNow() + place.entry.nLease);
+            LookAgain(key);
             return false;
         case Action::kInTheWay:
             place.verdict = InTheWay(place.entry);
@@ -374,7 +394,7 @@ bool Pass::Renew(const MappingKey& key, Place& place) {
     const bool blDoubtful = !mAbilities.blShows && (pMade == nullptr || pMade->blBefore);
     const bool blAgain = Add(key, place, false);
     if (!place.blWritten && MadeAt(key) != nullptr) {  // the lease runs on, where there is one
-        place.verdict = blDoubtful ? Refusal(place.answer) : Verdict{PortState::kOpen, "1", {}, place.entry.nLease};
+        place.verdict = blDoubtful ? RefusedBy(place.answer) : Verdict{PortState::kOpen, "1", {}, place.entry.nLease};
         Wake(mAround.fnNow() + kRenewAgain);
     }
     return blAgain;
@@ -383,7 +403,7 @@ bool Pass::Renew(const MappingKey& key, Place& place) {
 // Asks for what is wanted at a place. True: what is known of the place has changed, and is to be decided anew.
 bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
     if (const auto it = mHabit.mapElsewhere.find(key); it != mHabit.mapElsewhere.end()) {
-        place.verdict = Refusal({Reply::kElsewhere, it->second});
+        place.verdict = RefusedBy({Reply::kElsewhere, it->second});
         mRecord.Here().erase(key);
         return false;
     }
@@ -428,14 +448,8 @@ bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
 void Pass::OnMade(const MappingKey& key, Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew) {
     // Some say yes to a change, and leave the entry as it was.
     const bool blChange = mAbilities.blShows && place.enSeen == Seen::kPresent && blAnew;
-    mRecord.Here()[key] = {mAround.szBox,
-                           mapping.nBoxPort,
-                           mapping.szDescription,
-                           !mAbilities.blShows,
-                           mapping.nLease,
-                           nAsked,
-                           false,
-                           blChange ? place.entry.nBoxPort : uint16_t{0}};
+    mRecord.Here()[key] = RowOf(mapping, !mAbilities.blShows, nAsked);
+    mRecord.Here()[key].nOtherPort = blChange ? place.entry.nBoxPort : uint16_t{0};
     if (blAnew) {
         mAround.fnTell(mapping, {Action::kAdd, place.szWhy});
     }
@@ -457,15 +471,21 @@ void Pass::OnMade(const MappingKey& key, Place& place, const RouterMapping& mapp
 void Pass::OnElsewhere(const MappingKey& key, Place& place, const RouterMapping& made, const RouterReply& reply) {
     mRecord.Here().erase(key);
     place.enSeen = Seen::kHidden;
-    place.verdict = Refusal(reply);
+    place.verdict = RefusedBy(reply);
     Place& other = mMapPlaces[KeyOf(made)];
-    mRecord.Here()[KeyOf(made)] = {mAround.szBox, made.nBoxPort, made.szDescription,
-                                   true,          made.nLease,   mAround.fnNow()};
+    mRecord.Here()[KeyOf(made)] = RowOf(made, true, mAround.fnNow());
     other.enSeen = Seen::kPresent;
     other.entry = made;
     if (Remove(KeyOf(made), other)) {
         mAround.fnTell(made, {Action::kRemove, "the router made it instead of another one"});
         mHabit.mapElsewhere[key] = reply.szWord;
+    }
+}
+
+// What a form showed before something was done may look different afterwards.
+void Pass::LookAgain(const MappingKey& key) {
+    if (mAbilities.blForm && mAbilities.blShows) {
+        mRgWritten.push_back(key);
     }
 }
 
@@ -483,7 +503,7 @@ uint16_t Pass::OlderPlace(const MappingKey& key, uint16_t nBoxPort) const {
 
 // What was refused is not there, unless it was before.
 void Pass::OnRefused(const MappingKey& key, Place& place, const RouterReply& reply) {
-    place.verdict = Refusal(reply);
+    place.verdict = RefusedBy(reply);
     const Made* pMade = MadeAt(key);
     if (reply.IsRefusal() && place.enSeen == Seen::kAbsent && pMade != nullptr && !pMade->blShown) {
         mRecord.Here().erase(key);
@@ -504,7 +524,7 @@ void Pass::ShowRanges() {
             std::vector<RouterMapping> rgShown;
             blShows = Note(mRouter.ListRange(first->first, first->second, std::prev(end)->second, rgShown)).IsOk();
             for (const RouterMapping& entry : rgShown) {
-                Show(entry);
+                Show(KeyOf(entry), entry);
             }
         }
         first = end;
@@ -513,12 +533,15 @@ void Pass::ShowRanges() {
 
 // A router's yes is not enough: the mapping must be in its table, and be ours.
 void Pass::ReadBack() {
-    while (!mRgWritten.empty()) {  // once more for those that had to be replaced
+    do {  // once more for those that had to be replaced
+        if (mAbilities.blForm) {
+            mApplied = Note(mRouter.Apply());
+        }
         ShowRanges();
         for (const MappingKey& key : std::exchange(mRgWritten, {})) {
             Confirm(key, mMapPlaces[key]);
         }
-    }
+    } while (!mRgWritten.empty());
     mNReadBack = mAround.fnNow();
 }
 
@@ -528,15 +551,17 @@ void Pass::Confirm(const MappingKey& key, Place& place) {
         return place.enSeen == Seen::kPresent && Serves(place.entry, *place.pWanted, mAround.szBox);
     };
     RouterReply reply;
-    if (!fnServes()) {
+    if (!fnServes() || mAbilities.blForm) {
         reply = IsOver() ? Unasked() : Look(key, place);
     }
-    place.blWritten = false;
+    const bool blWritten = std::exchange(place.blWritten, false);
     if (fnServes()) {
-        place.verdict = Open(key, place);
-        place.verdict.blAnew = blAnew;
+        if (blWritten) {
+            place.verdict = Open(key, place);
+            place.verdict.blAnew = blAnew;
+        }
     } else if (IsOver() || (!reply.IsOk() && reply.enReply != Reply::kNoSuchEntry)) {
-        place.verdict = Refusal(reply);
+        place.verdict = RefusedBy(reply);
     } else if (place.enSeen == Seen::kPresent && IsOurs(place.entry, MadeAt(key), mAround.szBox) &&
                !std::exchange(place.blReplaced, true) && Remove(key, place)) {
         place.verdict = {PortState::kRefused, kLost};
@@ -567,7 +592,7 @@ Verdict Pass::Open(const MappingKey& key, const Place& place) {
 
 // A mapping that cannot be made because of another entry, and whose that is.
 Verdict Pass::InTheWay(const RouterMapping& entry) const {
-    Verdict verdict = Refusal({Reply::kConflict, mAbilities.szConflict});
+    Verdict verdict = RefusedBy({Reply::kConflict, mAbilities.szConflict});
     verdict.holder = Holder{entry.szClient, HarmlessText(entry.szDescription, kMaxDescription)};
     verdict.blOthers = entry.szClient == mAround.szBox;
     return verdict;
@@ -575,7 +600,7 @@ Verdict Pass::InTheWay(const RouterMapping& entry) const {
 
 // Ours, and the router does not take it away: from whom it belongs to, which this box is no more, until its lease ends.
 Verdict Pass::StillHeld(const MappingKey& key, const RouterReply& reply) {
-    Verdict verdict = Refusal(reply);
+    Verdict verdict = RefusedBy(reply);
     const Made* pMade = MadeAt(key);
     if (pMade == nullptr) {
         return verdict;
@@ -599,7 +624,7 @@ RouterMapping Pass::Known(const MappingKey& key, const Place& place) {
         return place.entry;
     }
     const auto nLeft = static_cast<uint32_t>(std::clamp<int64_t>(pMade->End() - mAround.fnNow(), 0, UINT32_MAX));
-    return {key.first, key.second, pMade->nBoxPort, pMade->szClient, pMade->szText, nLeft, true};
+    return {key.first, key.second, pMade->nBoxPort, pMade->szClient, pMade->szText, nLeft, true, pMade->nMore};
 }
 
 // What there is to say of a place that the router was not asked about any more.
@@ -617,7 +642,10 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = mMapPlaces[KeyOf(wanted)];
         if (place.verdict.szWord.empty()) {
-            place.verdict = Refusal(Unasked());
+            place.verdict = RefusedBy(Unasked());
+        }
+        if (place.verdict.enState == PortState::kOpen && !mApplied.IsOk()) {
+            place.verdict = RefusedBy(mApplied);
         }
         if (mResult.blUnfinished && mResult.transport.IsOk() && place.verdict.enState == PortState::kUnknown) {
             place.verdict.szWhy = kGoesOn;
@@ -630,7 +658,9 @@ void Pass::Conclude(const std::vector<RouterMapping>& rgWanted) {
     for (const auto& [key, place] : mMapPlaces) {
         const Made* pMade = MadeAt(key);
         const bool blThere = place.enSeen == Seen::kPresent && IsOurs(place.entry, pMade, mAround.szBox);
-        if (place.pWanted != nullptr || (!blThere && pMade == nullptr)) {
+        // What a form still has of before is there beside what is wanted.
+        const bool blBeside = mAbilities.blForm && !place.kept.IsOk();
+        if ((place.pWanted != nullptr && !blBeside) || (!blThere && pMade == nullptr)) {
             continue;
         }
         const RouterMapping left = Known(key, place);
@@ -672,7 +702,9 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
     if (const auto next = std::find(rgKeys.begin(), rgKeys.end(), mHabit.next); next != rgKeys.end()) {
         std::rotate(rgKeys.begin(), next, rgKeys.end());
     }
-    const size_t nTogether = std::max(kTogether, rgWanted.size() / kMostSaves + 1);
+    // On a form an entry of ours may be in the way of any other one.
+    const size_t nTogether =
+        std::max(mAbilities.blForm ? rgWanted.size() : kTogether, rgWanted.size() / kMostSaves + 1);
     for (size_t i = 0; i < rgKeys.size() && !IsOver();) {
         const auto first = rgKeys.begin() + static_cast<std::ptrdiff_t>(i);
         i += Bring({first, first + static_cast<std::ptrdiff_t>(std::min(nTogether, rgKeys.size() - i))});
@@ -692,7 +724,7 @@ PassResult Pass::Run(const std::vector<RouterMapping>& rgWanted) {
 
 }  // namespace
 
-Verdict Refusal(const RouterReply& reply) {
+Verdict RefusedBy(const RouterReply& reply) {
     const PortState enState = reply.IsRefusal() ? PortState::kRefused
                               : reply.IsOk()    ? PortState::kWaiting
                                                 : PortState::kUnknown;

@@ -46,6 +46,6 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
                        const Surroundings& around);
 
 // A mapping that is not there, as the router has it. kOk: it was not asked for.
-Verdict Refusal(const RouterReply& reply);
+Verdict RefusedBy(const RouterReply& reply);
 
 }  // namespace tavo

@@ -61,7 +61,9 @@ size_t CharacterSize(std::string_view szText) {
 }  // namespace
 
 std::string MappingName(const RouterMapping& mapping) {
-    return std::to_string(mapping.nRouterPort) + (mapping.szProtocol == "UDP" ? "/udp" : "/tcp");
+    const std::string szLast = mapping.nMore == 0 ? "" : "-" + std::to_string(mapping.nRouterPort + mapping.nMore);
+    const char* szProtocol = mapping.szProtocol == "UDP" ? "/udp" : mapping.szProtocol == "BOTH" ? "/both" : "/tcp";
+    return std::to_string(mapping.nRouterPort) + szLast + szProtocol;
 }
 
 Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {

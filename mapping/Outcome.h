@@ -66,7 +66,7 @@ using OutcomeList = std::vector<Outcome>;
 // The word for what was not asked for, because the box could not have remembered it.
 inline constexpr char kUnrecorded[] = "unrecorded";
 
-// "5000/tcp", as a user reads it.
+// "5000/tcp", or "5000-5010/both", as a user reads it.
 std::string MappingName(const RouterMapping& mapping);
 // What became of a mapping.
 Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict);

@@ -27,8 +27,11 @@ Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow, boo
     return view.pMade == nullptr ? Step{} : Step{Action::kForget, "somebody else has the place by now"};
 }
 
-Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNow) {
+Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNow, const Abilities& what) {
     const RouterMapping& entry = *view.pEntry;
+    if (KeyOf(entry) != KeyOf(*view.pWanted)) {
+        return {Action::kInTheWay, "another entry has one of its ports"};
+    }
     if (!IsOurs(entry, view.pMade, szBox)) {
         return Serves(entry, *view.pWanted, szBox) ? Step{Action::kLeave, "another program of this box made it"}
                                                    : Step{Action::kInTheWay, "somebody else has the place"};
@@ -37,7 +40,9 @@ Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNo
         return {Action::kReplace, "it leads to an address that this box had before"};
     }
     if (!Serves(entry, *view.pWanted, szBox)) {
-        return {Action::kChange, "it is to lead to another port of this box"};
+        // Where nobody could see what came of a change, or cannot ask for one, it is made anew.
+        return {what.blShows && !what.blForm ? Action::kChange : Action::kReplace,
+                "it is to lead to another port of this box"};
     }
     // One without our record was made before there was one: nobody knows how old its lease is.
     const bool blDue = entry.nLease != 0 && (view.pMade == nullptr || view.pMade->IsDue(nNow));
@@ -52,18 +57,24 @@ bool IsOurs(const RouterMapping& entry, const Made* pMade, const std::string& sz
 }
 
 bool Serves(const RouterMapping& entry, const RouterMapping& wanted, const std::string& szBox) {
-    return entry.szClient == szBox && entry.nBoxPort == wanted.nBoxPort && entry.blEnabled;
+    return entry.szClient == szBox && entry.nBoxPort == wanted.nBoxPort && entry.nMore == wanted.nMore &&
+           entry.blEnabled;
 }
 
-Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, bool blLeases) {
+Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, const Abilities& what) {
     if (view.pWanted == nullptr) {
-        return Unwanted(view, szBox, nNow, blLeases);
+        return Unwanted(view, szBox, nNow, what.blLeases);
     }
     switch (view.enSeen) {
         case Seen::kUnknown:
             return {Action::kLook, "a rule asks for it, and nobody has looked"};
         case Seen::kPresent:
-            return WantedAndThere(view, szBox, nNow);
+            return WantedAndThere(view, szBox, nNow, what);
+        case Seen::kHidden:
+            if (what.blForm && view.pMade != nullptr) {
+                return {Action::kReplace, "made anew: the answer shows whether it is there"};
+            }
+            [[fallthrough]];
         default:
             return {Action::kAdd, "a rule asks for it, and the router does not show it"};
     }

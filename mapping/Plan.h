@@ -50,7 +50,7 @@ bool IsOurs(const RouterMapping& entry, const Made* pMade, const std::string& sz
 bool Serves(const RouterMapping& entry, const RouterMapping& wanted, const std::string& szBox);
 
 // nNow: seconds of boot time.
-// blLeases: as a router's abilities have it.
-Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, bool blLeases = false);
+// what: the router can do.
+Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, const Abilities& what = {});
 
 }  // namespace tavo

@@ -44,8 +44,10 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
         row.made.blBefore = !blCounts || mapValues["before"] == "yes";
         row.made.nAsked = blCounts ? nAsked : 0;
         row.made.nOtherPort = NumberIn<uint16_t>(mapValues["other_port"]);
-        const bool blProtocol = row.key.first == "TCP" || row.key.first == "UDP";
-        if (blProtocol && row.key.second != 0 && row.made.nBoxPort != 0) {
+        row.made.nMore = NumberIn<uint16_t>(mapValues["more"]);
+        const bool blProtocol = row.key.first == "TCP" || row.key.first == "UDP" || row.key.first == "BOTH";
+        const int nLast = std::max(row.key.second, row.made.nBoxPort) + row.made.nMore;
+        if (blProtocol && row.key.second != 0 && row.made.nBoxPort != 0 && nLast <= UINT16_MAX) {
             mRgElsewhere.push_back(std::move(row));
         }
     }
@@ -103,6 +105,7 @@ std::string Record::Text() const {
                                {"protocol", key.first},
                                {"router_port", std::to_string(key.second)},
                                {"box_port", std::to_string(made.nBoxPort)},
+                               {"more", std::to_string(made.nMore)},
                                {"other_port", std::to_string(made.nOtherPort)},
                                {"client", made.szClient},
                                {"text", made.szText},

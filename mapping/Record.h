@@ -17,7 +17,7 @@
 namespace tavo {
 
 // A place in a router's table.
-using MappingKey = std::pair<std::string, uint16_t>;  // "TCP" or "UDP", the router's port
+using MappingKey = std::pair<std::string, uint16_t>;  // the entry's protocol and first port of the router
 
 inline MappingKey KeyOf(const RouterMapping& mapping) {
     return {mapping.szProtocol, mapping.nRouterPort};
@@ -46,11 +46,12 @@ struct Made {
     // The other port that it may lead to: a change was asked for, and what came of it was not shown. 0: none.
     uint16_t nOtherPort = 0;
     std::string szHardware = {};  // of the router that it was made at, where the one in front does not show its own
+    uint16_t nMore = 0;           // of a range
 
     // Whether an entry at its place is this one. Routers rewrite texts: until it is shown, what it leads to will do, or
     // our mark. A text that the router gives to everybody's says nothing.
     bool IsEntry(const RouterMapping& entry) const {
-        const bool blPort = entry.nBoxPort == nBoxPort;
+        const bool blPort = entry.nBoxPort == nBoxPort && entry.nMore == nMore;
         const bool blText = entry.szDescription == szText;
         const bool blOther = nOtherPort != 0 && entry.nBoxPort == nOtherPort;
         const bool blMark = blText && szText.starts_with(kOwnPrefix);

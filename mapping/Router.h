@@ -10,13 +10,14 @@
 namespace tavo {
 
 struct RouterMapping {
-    std::string szProtocol;  // "TCP" or "UDP"
+    std::string szProtocol;  // "TCP" or "UDP"; "BOTH" where one entry of the router is for the two
     uint16_t nRouterPort = 0;
     uint16_t nBoxPort = 0;
-    std::string szClient;       // dotted address of the host behind the port
+    std::string szClient;       // dotted address of the host behind the port; empty: the router does not show it
     std::string szDescription;  // printable, bounded
     uint32_t nLease = 0;        // seconds; 0: until the router restarts
     bool blEnabled = true;
+    uint16_t nMore = 0;  // further ports, one for one: the entry is a range
 };
 
 // All that a router can say. What its protocol calls it is known to the adapter alone.
@@ -51,6 +52,9 @@ struct Abilities {
     bool blLeases = false;     // every mapping ends by itself, whatever becomes of the answer
     bool blByBoxPort = false;  // it knows a mapping by its client and the client\'s port, and has one for each
     std::string szConflict = "conflict";  // its word for kConflict
+    // Its table is kept as in a form: an entry is changed by taking it away and making it anew, what was done takes
+    // effect together, by Apply(), and any change may move the other entries. To look at one costs nothing.
+    bool blForm = false;
 };
 
 class Router {
@@ -66,11 +70,14 @@ public:
                                   std::vector<RouterMapping>& /*rgMappings*/) {
         return {Reply::kRefused};
     }
+    // After kConflict: the entry in the way, which may be a range that begins elsewhere.
     virtual RouterReply Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) = 0;
     // mapping becomes what was made, as far as the router says: its lease, and with kElsewhere its port.
     virtual RouterReply Add(RouterMapping& mapping) = 0;
     // What is known of the mapping: protocols differ in what they call it by.
     virtual RouterReply Remove(const RouterMapping& mapping) = 0;
+    // Has what was done since take effect, on a form.
+    virtual RouterReply Apply() { return {}; }
 };
 
 }  // namespace tavo

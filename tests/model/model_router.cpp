@@ -2,6 +2,7 @@
 #include "model_router.h"
 
 #include <algorithm>
+#include <utility>
 
 namespace model {
 
@@ -44,13 +45,55 @@ tavo::RouterMapping Router::Shown(const Entry& entry) const {
     tavo::RouterMapping shown = entry.mapping;
     if (habits.blForgetsLease) {
         shown.nLease = 0;
+    } else if (habits.blHidesClient) {
+        shown.szClient.clear();
     } else if (habits.blListsWhatIsLeft && entry.nEnd != 0) {
         shown.nLease = static_cast<uint32_t>(entry.nEnd - mNNow);
     }
     return shown;
 }
 
+Reply Router::ReadForm() {
+    if (mBlListed || habits.blMute) {
+        return {};
+    }
+    return Answer([&]() -> Reply {
+        mBlListed = true;
+        mMapListed.clear();
+        for (const auto& [key, entry] : mMapTable) {
+            mMapListed[key] = Shown(entry);
+        }
+        return {};
+    });
+}
+
+Reply Router::FormGet(const tavo::MappingKey& key, tavo::RouterMapping& mapping) {
+    if (const Reply reply = ReadForm(); !reply.IsOk()) {
+        return reply;
+    }
+    const auto it = mMapListed.find(key);
+    if (it == mMapListed.end()) {
+        return {tavo::Reply::kNoSuchEntry, "not listed"};
+    }
+    mapping = it->second;
+    return {};
+}
+
+// Half done is what the answers to adding and deleting say: what is asked here may be lost like any other answer.
+Reply Router::Apply() {
+    return std::exchange(mBlChanged, false) ? Answer([] { return Reply{}; }) : Reply{};
+}
+
 Reply Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
+    if (habits.blForm) {
+        Reply reply = ReadForm();
+        for (const auto& [key, mapping] : mMapListed) {
+            if (mBlListed) {
+                rgMappings.push_back(mapping);
+            }
+        }
+        return reply;
+    }
     if (habits.blBlind) {
         return mAsked;
     }
@@ -84,6 +127,9 @@ Reply Router::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t
 }
 
 Reply Router::Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) {
+    if (habits.blForm) {
+        return FormGet({szProtocol, nRouterPort}, mapping);
+    }
     return Answer([&]() -> Reply {
         const Entry* pEntry = At({szProtocol, nRouterPort});
         if (pEntry == nullptr) {
@@ -100,6 +146,9 @@ Reply Router::DoAdd(const tavo::RouterMapping& mapping) {
     }
     const tavo::MappingKey key = tavo::KeyOf(mapping);
     const Entry* pThere = At(key);
+    if (pThere != nullptr && habits.blForm) {
+        return {tavo::Reply::kRefused, "in use"};
+    }
     if (pThere != nullptr) {
         const bool blSame = pThere->mapping.nBoxPort == mapping.nBoxPort;
         if (pThere->mapping.szClient != mapping.szClient || (!blSame && !habits.blOverwrites)) {
@@ -156,6 +205,8 @@ Reply Router::Add(tavo::RouterMapping& mapping) {
         szBroken = "a mapping for another host is asked for";
     }
     fnBeforeAdd(mapping);
+    mBlListed = false;
+    mBlChanged = true;
     const Reply reply = Answer([&] { return habits.blBlind ? DoGrant(mapping) : DoAdd(mapping); });
     fnTell("add " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " -> " + mapping.szClient + ":" +
            std::to_string(mapping.nBoxPort) + " = " + reply.szWord);
@@ -166,6 +217,10 @@ Reply Router::DoRemove(const tavo::RouterMapping& mapping) {
     const Entry* pEntry = habits.blBlind ? OfBoxPort(mapping) : At(tavo::KeyOf(mapping));
     if (pEntry == nullptr) {
         return habits.blBlind ? Reply{} : Reply{tavo::Reply::kNoSuchEntry, "714"};
+    }
+    if (habits.blMute &&
+        (pEntry->mapping.szClient != mapping.szClient || pEntry->mapping.nBoxPort != mapping.nBoxPort)) {
+        return {tavo::Reply::kNoSuchEntry, "no such rule"};
     }
     if (habits.blSecure && pEntry->mapping.szClient != szBox) {
         return {tavo::Reply::kRefused, "606"};
@@ -178,6 +233,8 @@ Reply Router::DoRemove(const tavo::RouterMapping& mapping) {
 }
 
 Reply Router::Remove(const tavo::RouterMapping& mapping) {
+    mBlListed = false;
+    mBlChanged = true;
     const bool blForeign = habits.blBlind && mapping.szClient != szBox;
     const Reply reply = blForeign ? Reply{tavo::Reply::kRefused, "former"} : Answer([&] { return DoRemove(mapping); });
     fnTell("remove " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " = " + reply.szWord);

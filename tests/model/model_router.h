@@ -35,6 +35,11 @@ struct Habits {
     // Shows nothing, lends everything, gives another port where the wanted one is taken, and knows a mapping by its
     // client and the client's port.
     bool blBlind = false;
+    // The router's own pages: no leases, an entry is never changed in place, the box reads the list once and after each
+    // change, and begins anew for each pass, with the record from the disk.
+    bool blForm = false;
+    bool blMute = false;         // of a form: it shows no list
+    bool blHidesClient = false;  // of a form: the list does not show whom an entry is for
 };
 
 class Router : public tavo::Router {
@@ -48,13 +53,16 @@ public:
         bool blOrphan = false;  // was made by it, and nobody can know that any more
     };
 
-    tavo::Abilities What() const override { return {!habits.blBlind, habits.blBlind, habits.blBlind}; }
+    tavo::Abilities What() const override {
+        return {!habits.blBlind && !habits.blMute, habits.blBlind, habits.blBlind, "conflict", habits.blForm};
+    }
     Reply List(std::vector<tavo::RouterMapping>& rgMappings) override;
     Reply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
                     std::vector<tavo::RouterMapping>& rgMappings) override;
     Reply Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::RouterMapping& mapping) override;
     Reply Add(tavo::RouterMapping& mapping) override;
     Reply Remove(const tavo::RouterMapping& mapping) override;
+    Reply Apply() override;
     // A question that changes nothing.
     Reply Ask(int& nLifeNow);
 
@@ -69,6 +77,8 @@ public:
     void Expire();
     // What is there now, without asking.
     const Entry* At(const tavo::MappingKey& key);
+    // Another process asks now.
+    void NewRun() { mBlListed = mBlChanged = false; }
     void Restart() {
         mMapTable.clear();
         ++nLife;
@@ -97,9 +107,15 @@ private:
     // As one that knows a mapping by its client and the client's port, and shows none.
     Reply DoGrant(tavo::RouterMapping& mapping);
     Reply DoRemove(const tavo::RouterMapping& mapping);
+    // A form's list as the box has it, read where that is needed.
+    Reply ReadForm();
+    Reply FormGet(const tavo::MappingKey& key, tavo::RouterMapping& mapping);
     const Entry* OfBoxPort(const tavo::RouterMapping& mapping) const;
 
     Reply mAsked;
+    bool mBlListed = false;   // the box has a form's list, and it is not out of date
+    bool mBlChanged = false;  // a form has done something that has not been applied
+    std::map<tavo::MappingKey, tavo::RouterMapping> mMapListed;
     std::mt19937& mRandom;
     const int64_t& mNNow;
 };

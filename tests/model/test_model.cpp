@@ -49,7 +49,14 @@ public:
         habits.blBlind = OneIn(4);
         habits.blSecure = habits.blSecure || habits.blBlind;
         habits.blForgetsLease = habits.blForgetsLease && !habits.blBlind;
-        mBlHardware = !OneIn(5);
+        if (OneIn(5)) {
+            habits = {.blPermanentOnly = true, .nText = OneIn(2) ? 0 : 2, .blForm = true, .blMute = OneIn(3)};
+            habits.blHidesClient = !habits.blMute && OneIn(3);
+            habits.nCapacity = OneIn(4) ? 4 + Pick(8) : 1000;
+            habits.blSaysFull = habits.blMute || OneIn(2);
+        }
+        // Nothing tells two routers apart whose lists leave out everything.
+        mBlHardware = !OneIn(5) || habits.blHidesClient;
         mNCheck = OneIn(2) ? 120 : 600;
         mRouter.szBox = "192.168.1.5";
         mRouter.fnTell = [this](std::string szWhat) { Tell("  " + std::move(szWhat)); };
@@ -221,11 +228,15 @@ private:
         const int nRequestsBefore = mRouter.nRequests;
         const int64_t nAllowance =
             mRouter.nLosePerMille + mRouter.nKillPerMille + mRouter.nSkipPerMille + (mRouter.blAway ? 1 : 0) + mNStopIn;
+        if (mRouter.habits.blForm) {
+            mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
+            mRouter.NewRun();
+        }
         mPRecord->TurnTo(Name());
         mPRecord->Prune(mNNow - mNBootAt, mRouter.habits.blBlind);
         const std::string szRecordBefore = mPRecord->Text();
         mNAdds = 0;
-        mHabit.nLease = 3600;
+        mHabit.nLease = mRouter.habits.blForm ? 0 : 3600;
         tavo::PassResult result;
         try {
             Ask();
@@ -259,6 +270,9 @@ private:
         }
         mBlQuiet = mBlQuiet || mNPeace >= kPassesToPeace;
     }
+
+    // What was forgotten is forgotten again by the next process.
+    bool HasNoRecord() const { return mRouter.habits.blForm && mBlDiskFull; }
 
     // What natpmpd learns of a blind router before it asks for anything.
     void Ask() {
@@ -306,7 +320,8 @@ private:
             std::all_of(result.rgOutcomes.begin(), result.rgOutcomes.end(), [](const tavo::Outcome& outcome) {
                 return outcome.verdict.enState == tavo::PortState::kOpen && !outcome.blLeftOver;
             });
-        if (std::exchange(mBlAllOpen, blAllOpen) && blAllOpen && (nRequests != 1 || blWritten)) {
+        if (std::exchange(mBlAllOpen, blAllOpen) && blAllOpen && !mRouter.habits.blMute && !HasNoRecord() &&
+            (nRequests != 1 || blWritten)) {
             Broken(std::to_string(nRequests) + " requests" + (blWritten ? " and a write" : "") + " about nothing",
                    {"TCP", 1});
         }
@@ -355,7 +370,8 @@ private:
             if (!blTrouble && verdict.szWord == "lost" && blThere) {
                 Broken("said to be lost and is there", key);
             }
-            if (mBlQuiet && !blTrouble && verdict.blAnew && mSetOpen.contains(key) && !mRouter.habits.blForgetsLease) {
+            if (mBlQuiet && !blTrouble && verdict.blAnew && mSetOpen.contains(key) && !mRouter.habits.blForgetsLease &&
+                !mRouter.habits.blMute) {
                 Broken("made anew where nothing had happened: closed until now", key);
             }
             if (verdict.enState == tavo::PortState::kOpen && pEntry != nullptr && pEntry->blBox) {

@@ -215,6 +215,125 @@ TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
     EXPECT_EQ(router.mRgszRanges, (std::vector<std::string>{"TCP 1-64", "TCP 65-70", "UDP 70-73"}));
 }
 
+// The pages of a router: entries are ranges, none is changed in place, and what was done takes effect together.
+class FormRouter : public MemoryRouter {
+public:
+    tavo::Abilities What() const override { return {.szConflict = "taken", .blForm = true}; }
+    const RouterMapping* InTheWay(const RouterMapping& mapping) const {
+        for (const auto& [key, entry] : mMapTable) {
+            if (entry.nRouterPort <= mapping.nRouterPort + mapping.nMore &&
+                mapping.nRouterPort <= entry.nRouterPort + entry.nMore) {
+                return &entry;
+            }
+        }
+        return nullptr;
+    }
+    RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+        const auto it = mMapInTheWay.find({szProtocol, nPort});
+        if (mMapTable.contains({szProtocol, nPort}) || it == mMapInTheWay.end()) {
+            return MemoryRouter::Get(szProtocol, nPort, mapping);
+        }
+        mapping = it->second;
+        return {};
+    }
+    RouterReply Add(RouterMapping& mapping) override {
+        if (const RouterMapping* pEntry = InTheWay(mapping)) {
+            mMapInTheWay[tavo::KeyOf(mapping)] = *pEntry;
+            return {tavo::Reply::kConflict, "taken"};
+        }
+        return MemoryRouter::Add(mapping);
+    }
+    RouterReply Remove(const RouterMapping& mapping) override {
+        mMapTable.erase({"TCP", mNTornAway});
+        return MemoryRouter::Remove(mapping);
+    }
+    RouterReply Apply() override {
+        ++mNApplied;
+        return mBlApplies ? RouterReply{} : RouterReply{tavo::Reply::kRefused, "not applied"};
+    }
+
+    std::map<tavo::MappingKey, RouterMapping> mMapInTheWay;
+    bool mBlApplies = true;
+    uint16_t mNTornAway = 0;  // goes with any other one
+    int mNApplied = 0;
+};
+
+RouterMapping Range(RouterMapping mapping, uint16_t nMore) {
+    mapping.nMore = nMore;
+    mapping.nLease = 0;
+    return mapping;
+}
+
+TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
+    struct Case {
+        const char* szWhat;
+        bool blApplies;
+        uint16_t nTornAway;
+        std::vector<std::string> rgExpected;
+    };
+    const std::string szTaken = "30-32/tcp taken 192.168.1.9 tavo:theirs";
+    for (const Case& row : {Case{"all is well", true, 0, {"1/tcp 1", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}},
+                            Case{"nothing takes effect",
+                                 false,
+                                 0,
+                                 {"1/tcp not applied", "10-11/tcp not applied", "20/tcp not applied", szTaken}},
+                            Case{"another one goes with what is taken away",
+                                 true,
+                                 1,
+                                 {"1/tcp lost", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}}}) {
+        SCOPED_TRACE(row.szWhat);
+        FormRouter router;
+        for (const RouterMapping& mapping :
+             {Range(Entry(1, 1, kBox, "tavo:a"), 0), Range(Entry(10, 10, kBox, "tavo:b"), 5),
+              Range(Entry(20, 9, kBox, "tavo:c"), 0), Range(Entry(31, 31, "192.168.1.9", "tavo:theirs"), 9),
+              Range(Entry(50, 50, kBox, "tavo:gone"), 1)}) {
+            router.Put(mapping);
+        }
+        router.mBlApplies = row.blApplies;
+        router.mNTornAway = row.nTornAway;
+        Core core;
+        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a"), Range(Entry(10, 10, "", "tavo:b"), 1),
+                                              Entry(20, 20, "", "tavo:c"), Range(Entry(30, 30, "", "tavo:d"), 2)});
+        EXPECT_EQ(Texts(result), row.rgExpected);
+        EXPECT_EQ(router.mNApplied, 1);
+        EXPECT_EQ((router.mMapTable[{"TCP", 10}].nMore), 1);
+        EXPECT_EQ((router.mMapTable[{"TCP", 31}].nMore), 9);
+        EXPECT_FALSE((router.mMapTable.contains({"TCP", 50})));
+        EXPECT_FALSE((core.record.Here().contains({"TCP", 30}))) << "what could not be made is nothing of ours";
+        EXPECT_EQ((core.record.Here()[{"TCP", 10}].nMore), 1);
+    }
+}
+
+// A list without names, or without addresses: ours is what the record knows, and what looks like it no more.
+TEST(Mapping, WhatAListLeavesOutTheRecordKnows) {
+    struct Case {
+        const char* szShownClient;
+        const char* szShownText;
+        uint16_t nShownMore;
+        bool blOurs;
+    };
+    for (const Case& row : {Case{"", "tavo:a", 2, true}, Case{"", "", 2, true}, Case{kBox, "", 2, true},
+                            Case{"192.168.1.9", "", 2, false}, Case{"", "game", 2, false}, Case{kBox, "", 3, false}}) {
+        for (const bool blKnown : {true, false}) {
+            SCOPED_TRACE(std::string(row.szShownClient) + "/" + row.szShownText + (blKnown ? " known" : ""));
+            FormRouter router;
+            router.Put(Range(Entry(1, 1, row.szShownClient, row.szShownText), row.nShownMore));
+            Core core;
+            core.record.TurnTo({"192.168.1.1", ""});
+            if (blKnown) {
+                tavo::Made& made = core.record.Here()[{"TCP", 1}];
+                made = {kBox, 1, row.szShownText};
+                made.nMore = 2;
+            }
+            const std::vector<RouterMapping> rgWanted = {Range(Entry(1, 1, "", "tavo:a"), 2)};
+            const bool blServes = (blKnown && row.blOurs) || (kBox == std::string(row.szShownClient) && row.blOurs);
+            EXPECT_EQ(core.Run(router, rgWanted).rgOutcomes[0].verdict.szWord, blServes ? "1" : "taken");
+            core.Run(router, {});
+            EXPECT_EQ(router.mMapTable.empty(), blKnown && row.blOurs);
+        }
+    }
+}
+
 TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
     MemoryRouter router;
     router.Put(Entry(1, 1, kBox, "tavo:old"));
@@ -469,6 +588,8 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     record.TurnTo({"192.168.1.1", "cc:dd"});
     EXPECT_TRUE(record.Here().empty()) << "another device at the same address";
     record.Here()[{"UDP", 2}] = {kBox, 2, "tavo:b", true, 0, 5000};
+    record.Here()[{"BOTH", 65000}] = {kBox, 3, "tavo:range", true, 0, 5000};
+    record.Here()[{"BOTH", 65000}].nMore = 535;
     const std::string szText = record.Text();
 
     tavo::Record same(szText, "one");
@@ -498,7 +619,8 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     later.TurnTo({"192.168.1.1", "aa:bb"});
     EXPECT_TRUE(later.Here().empty()) << "its lease has surely ended, whenever it was asked for";
     later.TurnTo({"192.168.1.1", "cc:dd"});
-    EXPECT_EQ(later.Here().size(), 1U) << "this one never ends";
+    EXPECT_EQ(later.Here().size(), 2U) << "these never end";
+    EXPECT_EQ((later.Here()[{"BOTH", 65000}].nMore), 535);
     EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
 }
 
@@ -510,6 +632,11 @@ TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
     }
     const std::string szText = record.Text();
     // What of the second row is written over.
+    std::string szBeyond = szText;
+    szBeyond.replace(szBeyond.find("more=\"0\""), 8, "more=\"65535\"");
+    tavo::Record beyond(szBeyond, "one");
+    beyond.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_EQ(beyond.Here().size(), 2U) << "no range goes beyond the last port";
     for (const char* szDamaged : {"[192.168.1.1 TCP 2]", "router_port=\"2\"", "protocol=\"TCP\"\nrouter_port=\"2\""}) {
         std::string szBad = szText;
         szBad.replace(szText.find(szDamaged), 8, std::string("\0\xff\x1b\"=[\\q", 8));
