@@ -88,7 +88,7 @@ alive upnpd || fail "what was switched on does not run again"
 # A removal that is broken off: what it ended and took away comes back, also on a router's own pages (here is none).
 script() { "/var/lib/dpkg/info/tavoportmap.$1" "$2" 2>&1; }
 for szRules in there missing; do
-    echo 'tcp' >/var/lib/tavo/manual_router.made
+    echo 'tcp' >/var/lib/tavo/pages_made.conf
     [ $szRules = missing ] || echo '# mine' >/etc/portforward/rule.conf
     script prerm remove | grep -q 'the router keeps forwards' && ! alive upnpd || fail "pages are not cleared, rules $szRules"
     [ $szRules = missing ] || grep -q mine /etc/portforward/rule.conf || fail "the rules went with the forwards"

@@ -8,6 +8,7 @@
 
 #include "ground/ConfList.h"
 #include "ground/PortText.h"
+#include "mapping/Record.h"
 #include "programs/common/Wanted.h"
 
 namespace tavo {
@@ -49,7 +50,9 @@ public:
 private:
     void AddJob(Job job, const ProtocolSet& protocols);
     void Keep(Job job, const char* szProtocol, bool blTaken);
-    void Refuse(const Job& job, const char* szWhy) { mJobs.rgRefusals.push_back({job.Text(), szWhy, job}); }
+    void Refuse(const Job& job, const char* szWhy) {
+        mJobs.rgRefusals.push_back({MappingName(job.mapping), szWhy, job});
+    }
     void RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy);
 
     Page mPort;
@@ -58,9 +61,7 @@ private:
 };
 
 void Splitter::RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy) {
-    Job job;
-    job.szRule = RuleTitle(pRule);
-    mJobs.rgRefusals.push_back({RuleName(pRule), szWhy, job});
+    mJobs.rgRefusals.push_back({RuleName(pRule), szWhy, {{}, RuleTitle(pRule)}});
 }
 
 void Splitter::Add(const TAVO_PF_CONF* pRule) {
@@ -78,60 +79,63 @@ void Splitter::Add(const TAVO_PF_CONF* pRule) {
     }
     size_t nPair = 0;
     for (const PortRange& range : *rgRanges) {
-        const size_t nFirst = nPair;
-        nPair += static_cast<size_t>(range.nLast - range.nFirst) + 1;
-        const uint16_t nBoxFirst = (*rgPairs)[nFirst].nBoxPort;
-        const Job job{"", range.nFirst, range.nLast, nBoxFirst, MappingDescription(pRule), RuleTitle(pRule)};
-        if ((*rgPairs)[nPair - 1].nBoxPort - nBoxFirst != range.nLast - range.nFirst) {
+        const auto nMore = static_cast<uint16_t>(range.nLast - range.nFirst);
+        const uint16_t nBoxFirst = (*rgPairs)[nPair].nBoxPort;
+        nPair += size_t{nMore} + 1;
+        if ((*rgPairs)[nPair - 1].nBoxPort - nBoxFirst != nMore) {
             RefuseRule(pRule, "a range of router ports needs one range of the box's ports");
             continue;
         }
-        AddJob(job, *protocols);
+        AddJob({{"", range.nFirst, nBoxFirst, "", MappingDescription(pRule), 0, true, nMore}, RuleTitle(pRule)},
+               *protocols);
     }
 }
 
 void Splitter::AddJob(Job job, const ProtocolSet& protocols) {
-    const Page& page = job.IsRange() ? mRange : mPort;
+    const Page& page = job.mapping.nMore != 0 ? mRange : mPort;
     const bool blBoth = protocols.blTcp && protocols.blUdp;
     if (!page.blThere) {
-        job.szProtocol = blBoth ? "both" : (protocols.blTcp ? "tcp" : "udp");
+        job.mapping.szProtocol = blBoth ? "BOTH" : protocols.blTcp ? "TCP" : "UDP";
         Refuse(job, "the router has no page for this kind of forward");
     } else if (blBoth && page.blBoth) {
-        Keep(job, "both", true);
+        Keep(job, "BOTH", true);
     } else {
         if (protocols.blTcp) {
-            Keep(job, "tcp", page.blTcp);
+            Keep(job, "TCP", page.blTcp);
         }
         if (protocols.blUdp) {
-            Keep(job, "udp", page.blUdp);
+            Keep(job, "UDP", page.blUdp);
         }
     }
 }
 
 void Splitter::Keep(Job job, const char* szProtocol, bool blTaken) {
-    const Page& page = job.IsRange() ? mRange : mPort;
-    job.szProtocol = szProtocol;
+    const Page& page = job.mapping.nMore != 0 ? mRange : mPort;
+    const auto fnAny = [&](bool (*fnIs)(const RouterMapping&, const RouterMapping&)) {
+        return std::any_of(mJobs.rgJobs.begin(), mJobs.rgJobs.end(),
+                           [&](const Job& other) { return fnIs(other.mapping, job.mapping); });
+    };
+    job.mapping.szProtocol = szProtocol;
     if (!blTaken) {
         Refuse(job, "the router does not forward this protocol");
-    } else if (!page.blChangePort && job.nRouterFirst != job.nBoxFirst) {
+    } else if (!page.blChangePort && job.mapping.nRouterPort != job.mapping.nBoxPort) {
         Refuse(job, "the router cannot forward to another port number");
-    } else if (std::none_of(mJobs.rgJobs.begin(), mJobs.rgJobs.end(),
-                            [&](const Job& other) { return other.IsSame(job); })) {
-        const bool blClash =
-            std::any_of(mJobs.rgJobs.begin(), mJobs.rgJobs.end(), [&](const Job& other) { return other.Clashes(job); });
-        if (blClash) {
-            Refuse(job, "another rule has asked for this port already");
-        } else {
-            mJobs.rgJobs.push_back(std::move(job));
-        }
+    } else if (!fnAny(IsSame) && fnAny(Clash)) {
+        Refuse(job, "another rule has asked for this port already");
+    } else if (!fnAny(IsSame)) {
+        mJobs.rgJobs.push_back(std::move(job));
     }
 }
 
 }  // namespace
 
-std::string Job::Text() const {
-    const std::string szLast = IsRange() ? "-" + std::to_string(nRouterLast) : "";
-    return std::to_string(nRouterFirst) + szLast + "/" + szProtocol;
+bool IsSame(const RouterMapping& one, const RouterMapping& other) {
+    return KeyOf(one) == KeyOf(other) && one.nMore == other.nMore && one.nBoxPort == other.nBoxPort;
+}
+
+bool Clash(const RouterMapping& one, const RouterMapping& other) {
+    return one.nRouterPort <= other.nRouterPort + other.nMore && other.nRouterPort <= one.nRouterPort + one.nMore &&
+           (one.szProtocol == other.szProtocol || one.szProtocol == "BOTH" || other.szProtocol == "BOTH");
 }
 
 JobSet ReadJobs(const TAVO_PF_CONF* pDescription) {

@@ -9,34 +9,20 @@
 #include <vector>
 
 #include "mapping/Outcome.h"
+#include "mapping/Router.h"
 #include "tavo/portforward.h"
 
 namespace tavo {
 
 struct Job {
-    std::string szProtocol;  // "tcp", "udp" or "both"
-    uint16_t nRouterFirst = 0;
-    uint16_t nRouterLast = 0;
-    uint16_t nBoxFirst = 0;
-    std::string szName;       // as MappingDescription() makes it
-    std::string szRule = {};  // as the user named it
-
-    bool IsRange() const { return nRouterFirst != nRouterLast; }
-    uint16_t BoxLast() const { return static_cast<uint16_t>(nBoxFirst + (nRouterLast - nRouterFirst)); }
-    // "5000-5010/tcp", as a user reads it.
-    std::string Text() const;
-    // Whether both are the same forward; the names do not count.
-    bool IsSame(const Job& other) const { return HasSamePlace(other) && nBoxFirst == other.nBoxFirst; }
-    // Whether both are the router's entry for the same ports and protocol.
-    bool HasSamePlace(const Job& other) const {
-        return szProtocol == other.szProtocol && nRouterFirst == other.nRouterFirst && nRouterLast == other.nRouterLast;
-    }
-    // Whether one router cannot hold both.
-    bool Clashes(const Job& other) const {
-        return nRouterFirst <= other.nRouterLast && other.nRouterFirst <= nRouterLast &&
-               (szProtocol == other.szProtocol || szProtocol == "both" || other.szProtocol == "both");
-    }
+    RouterMapping mapping = {};  // with its client unset
+    std::string szRule = {};     // as the user named it
 };
+
+// Whether both are the same forward; the names do not count.
+bool IsSame(const RouterMapping& one, const RouterMapping& other);
+// Whether one router cannot hold both.
+bool Clash(const RouterMapping& one, const RouterMapping& other);
 
 enum class RefusalKind {
     kForward,  // a forward, or a whole rule, that is not in place
@@ -45,7 +31,7 @@ enum class RefusalKind {
 };
 
 struct Refusal {
-    std::string szWhat;  // job or rule as a user reads it
+    std::string szWhat;  // job, rule or concern as a user reads it
     std::string szWhy;
     Job job = {};  // no ports: it is about a whole rule, or about the run
     RefusalKind enKind = RefusalKind::kForward;

@@ -9,6 +9,7 @@ namespace {
 
 constexpr size_t kMaxEntries = 1024;
 constexpr int kSilentLimit = 2;
+constexpr char kSilent[] = "the router has stopped answering";
 constexpr long kUnauthorised = 401;
 constexpr long kForbidden = 403;
 
@@ -77,14 +78,16 @@ bool Session::PerformOne(const Operation& operation, const Values& values, StepR
     request.szPath = std::move(*szPath);
     if (mNSilent >= kSilentLimit) {
         result.enEnd = mEnTrouble;
-        return Fail(result, "the router has stopped answering");
+        return Fail(result, kSilent);
     }
     const WebAnswer answer = mClient.Send(request);
     mNSilent = answer.enEnd == WebEnd::kAnswered ? 0 : mNSilent + 1;
     if (answer.enEnd != WebEnd::kAnswered) {
         result.enEnd = mEnTrouble = answer.enEnd;
         result.blAnswered = answer.enEnd == WebEnd::kUnreachable;
-        return Fail(result, std::string(EndText(answer.enEnd)) + " (step \"" + operation.szStep + "\")");
+        return Fail(result, mNSilent >= kSilentLimit
+                                ? kSilent
+                                : std::string(EndText(answer.enEnd)) + " (step \"" + operation.szStep + "\")");
     }
     return Judge(operation, answer, result) && Take(operation, answer, result);
 }

@@ -15,8 +15,8 @@ struct StepResult {
     bool blDone = false;
     bool blAnswered = true;  // false: the router may or may not have done it
     bool blWasGone = false;  // a deletion that found nothing to delete
-    std::string szWhy;       // of a step that was not done
-    std::vector<Captures> rgEntries;
+    std::string szWhy = {};  // of a step that was not done
+    std::vector<Captures> rgEntries = {};
     WebEnd enEnd = WebEnd::kAnswered;  // of the request that failed
 };
 

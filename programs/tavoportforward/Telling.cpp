@@ -31,13 +31,14 @@ void AddEvent(const std::string& szWhat, const std::string& szWhy) {
 void Log(const std::vector<Refusal>& rgRefusals) {
     std::vector<std::pair<std::string, std::string>> rgEvents;  // reason, what it holds for
     for (const Refusal& refusal : rgRefusals) {
-        SysLog(LOG_ERR, "%s: %s", refusal.szWhat.c_str(), refusal.szWhy.c_str());
+        const std::string szWhat = (refusal.enKind == RefusalKind::kRemoval ? "removal of " : "") + refusal.szWhat;
+        SysLog(LOG_ERR, "%s: %s", szWhat.c_str(), refusal.szWhy.c_str());
         const auto it = std::find_if(rgEvents.begin(), rgEvents.end(),
                                      [&](const auto& event) { return event.first == refusal.szWhy; });
         if (it == rgEvents.end()) {
-            rgEvents.emplace_back(refusal.szWhy, refusal.szWhat);
+            rgEvents.emplace_back(refusal.szWhy, szWhat);
         } else if (it->second.size() < kMaxText) {
-            it->second += ", " + refusal.szWhat;
+            it->second += ", " + szWhat;
         }
     }
     for (const auto& [szWhy, szWhat] : rgEvents) {
@@ -49,18 +50,18 @@ void Log(const std::vector<Refusal>& rgRefusals) {
 void AddRows(const Job& job, const std::string& szName, const Verdict& verdict, OutcomeList& rgOutcomes) {
     Outcome outcome{szName, verdict};
     outcome.szRule = job.szRule;
-    if (job.nRouterFirst == 0) {
+    if (job.mapping.nRouterPort == 0) {
         rgOutcomes.push_back(outcome);
         return;
     }
     for (const char* szProtocol : {"TCP", "UDP"}) {
-        if (job.szProtocol == (szProtocol == std::string("TCP") ? "udp" : "tcp")) {
+        if (job.mapping.szProtocol != szProtocol && job.mapping.szProtocol != "BOTH") {
             continue;
         }
         outcome.szProtocol = szProtocol;
-        for (int nPort = job.nRouterFirst; nPort <= job.nRouterLast; ++nPort) {
-            outcome.nRouterPort = static_cast<uint16_t>(nPort);
-            outcome.nBoxPort = static_cast<uint16_t>(job.nBoxFirst + (nPort - job.nRouterFirst));
+        for (int i = 0; i <= job.mapping.nMore; ++i) {
+            outcome.nRouterPort = static_cast<uint16_t>(job.mapping.nRouterPort + i);
+            outcome.nBoxPort = static_cast<uint16_t>(job.mapping.nBoxPort + i);
             outcome.szName = PortName(szProtocol, outcome.nRouterPort);
             rgOutcomes.push_back(outcome);
         }
@@ -78,9 +79,10 @@ Verdict NotInPlace(const Refusal& refusal) {
 OutcomeList Outcomes(const RunResult& result) {
     OutcomeList rgOutcomes;
     for (const Job& job : result.rgWanted) {
-        const bool blInPlace = std::none_of(
-            result.rgRefusals.begin(), result.rgRefusals.end(),
-            [&](const Refusal& refusal) { return refusal.enKind == RefusalKind::kForward && refusal.job.IsSame(job); });
+        const bool blInPlace =
+            std::none_of(result.rgRefusals.begin(), result.rgRefusals.end(), [&](const Refusal& refusal) {
+                return refusal.enKind == RefusalKind::kForward && IsSame(refusal.job.mapping, job.mapping);
+            });
         if (blInPlace) {
             AddRows(job, "", {PortState::kOpen, "1"}, rgOutcomes);
         }
@@ -89,7 +91,7 @@ OutcomeList Outcomes(const RunResult& result) {
         if (refusal.enKind == RefusalKind::kForward) {
             AddRows(refusal.job, refusal.szWhat, NotInPlace(refusal), rgOutcomes);
         } else if (refusal.enKind == RefusalKind::kRemoval) {
-            rgOutcomes.push_back({refusal.job.Text(), NotInPlace(refusal)});
+            rgOutcomes.push_back({refusal.szWhat, NotInPlace(refusal)});
             rgOutcomes.back().blLeftOver = true;
         }
     }
@@ -136,13 +138,8 @@ void TellNotTried(RunResult result, const std::string& szWhy) {
             continue;
         }
         for (const SingleMapping& single : rgSingles.value_or(std::vector<SingleMapping>())) {
-            const Job job{single.szProtocol == "TCP" ? "tcp" : "udp",
-                          single.nRouterPort,
-                          single.nRouterPort,
-                          single.nBoxPort,
-                          "",
-                          RuleTitle(pRule)};
-            result.rgRefusals.push_back({job.Text(), szWhy, job, RefusalKind::kForward, false});
+            const Job job{{single.szProtocol, single.nRouterPort, single.nBoxPort, "", ""}, RuleTitle(pRule)};
+            result.rgRefusals.push_back({MappingName(job.mapping), szWhy, job, RefusalKind::kForward, false});
         }
     }
     PublishRun(result);

@@ -19,6 +19,7 @@
 #include "ground/RouterScript.h"
 #include "ground/TextFile.h"
 #include "programs/tavoportforward/Description.h"
+#include "programs/tavoportforward/EarlierRecord.h"
 #include "programs/tavoportforward/Forwarder.h"
 #include "programs/tavoportforward/Telling.h"
 #include "tavo/net.h"
@@ -34,7 +35,7 @@ constexpr char kHelp[] =
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
     "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
     "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
-    "for: /var/lib/tavo/manual_router.made remembers it, and is the only memory of a router that shows no list.\n"
+    "for: /var/lib/tavo/pages_made.conf remembers it, and is the only memory of a router that shows no list.\n"
     "What became of each port stands in /run/tavo/tavoportforward.json.\n"
     "\n"
     "  --version   the version of the operations syntax that this tool understands\n"
@@ -43,6 +44,7 @@ constexpr char kHelp[] =
     "\n"
     "Exit status: 0 all is in place (or good); 1 some forwards are not (see the system log\n"
     "and /var/log/tavo/event.log), or a checked file is bad; 2 unknown argument; 3 nothing could be tried.\n";
+constexpr char kMadeFile[] = "/var/lib/tavo/pages_made.conf";
 constexpr char kLock[] = "/var/run/tavoportforward.lock";
 constexpr auto kRunLimit = std::chrono::seconds(180);  // well below the five minutes that a save waits
 constexpr int kAddressSize = 64;
@@ -183,9 +185,11 @@ int Run() {
                            {"gateway", router.szGateway},
                            {"url", router.web.Url()},
                            {"box", router.szBox}});
-    tavo::MadeJobs made(router.szGateway, router.szBox);
+    tavo::MadeFile made(kMadeFile);
+    tavo::TakeOverEarlierRecord(made);
     tavo::RunResult result{router.szGateway, router.szBox};
-    result.rgRefusals = tavo::Forwarder(session, router.operations, made, router.szBox).Run(jobs.rgJobs);
+    tavo::Forwarder forwarder(session, router.operations, made, router.szBox);
+    result.rgRefusals = forwarder.Run(router.szGateway, jobs.rgJobs);
     result.enRouter = StateAfter(session.LastTrouble());
     result.szRouterWhy = RouterWhy(result.rgRefusals);
     result.rgRefusals.insert(result.rgRefusals.end(), jobs.rgRefusals.begin(), jobs.rgRefusals.end());

@@ -97,9 +97,11 @@ bool TestMappings::Choose(TestRule& rule) {
     return false;
 }
 
-RouterReply TestMappings::Ask(const TestRule& rule) {
+RouterReply TestMappings::Ask(Step& step, TestRule& rule) {
     RouterMapping mapping = MappingOf(rule);
-    return AddWithLease(mRouter, mapping, mHabit);
+    RouterReply reply = step.guard.Note(AddWithLease(mRouter, mapping, mHabit));
+    rule.szResult = reply.IsOk() ? kMade : reply.szWord;
+    return reply;
 }
 
 // Asks for a rule's mapping, on another port where somebody else has this one.
@@ -116,9 +118,8 @@ RouterReply TestMappings::AskSomewhere(Step& step, TestRule& rule) {
             rule.szResult = kUntried;  // somebody has it, or nobody knows
             continue;
         }
-        reply = step.guard.Note(Ask(rule));
+        reply = Ask(step, rule);
         step.nConflicts += reply.enReply == Reply::kConflict ? 1 : 0;
-        rule.szResult = reply.IsOk() ? kMade : reply.szWord;
     }
     return reply;
 }
@@ -186,8 +187,7 @@ bool TestMappings::Readd(const Stop& fnStop) {
         if (step.guard.IsOver()) {
             return false;
         }
-        const RouterReply reply = step.guard.Note(Ask(*pRule));
-        pRule->szResult = reply.IsOk() ? kMade : reply.szWord;
+        Ask(step, *pRule);
     }
     return ReadBack(step, rgpKept) && Kept().size() == rgpKept.size();
 }
@@ -212,8 +212,7 @@ bool TestMappings::Change(const Stop& fnStop) {
     }
     for (size_t i = 0; i < rgpChanged.size() && !step.guard.IsOver(); ++i) {
         rgpChanged[i]->nBoxPort = rgPorts[i];
-        const RouterReply reply = step.guard.Note(Ask(*rgpChanged[i]));
-        rgpChanged[i]->szResult = reply.IsOk() ? kMade : reply.szWord;
+        Ask(step, *rgpChanged[i]);
     }
     return ReadBack(step, rgpChanged) &&
            std::all_of(rgpChanged.begin(), rgpChanged.end(), [](const TestRule* pRule) { return pRule->blKept; });

@@ -42,7 +42,7 @@ private:
     bool IsTestMapping(const RouterMapping& entry) const;
     RouterMapping MappingOf(const TestRule& rule) const;
     bool Choose(TestRule& rule);
-    RouterReply Ask(const TestRule& rule);
+    RouterReply Ask(Step& step, TestRule& rule);
     RouterReply AskSomewhere(Step& step, TestRule& rule);
     bool IsShown(Step& step, const TestRule& rule, bool& blShown);
     bool ReadBack(Step& step, const std::vector<TestRule*>& rgpRules);

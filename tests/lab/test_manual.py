@@ -10,6 +10,7 @@ from homelab import BOX, GATEWAY, HERE, LAN2, run_tests, wait_for
 LAB = None
 TOOL = "/usr/tavo/bin/tavoportforward"
 EVENTS = "/var/log/tavo/event.log"
+RECORD, EARLIER = "/var/lib/tavo/pages_made.conf", "/var/lib/tavo/manual_router.made"
 FOREIGN = {("tcp", 9999): (LAN2, 9999)}
 
 
@@ -27,7 +28,7 @@ class Manual(unittest.TestCase):
 
     @staticmethod
     def forget():
-        for path in (EVENTS, "/etc/portforward/rule.conf", "/var/lib/tavo/manual_router.made"):
+        for path in (EVENTS, "/etc/portforward/rule.conf", RECORD, EARLIER):
             if os.path.exists(path):
                 os.unlink(path)
 
@@ -163,6 +164,37 @@ class Manual(unittest.TestCase):
         LAB.start_web("form", "hangs_on_add")
         LAB.save(*(f"{port},1,tcp,{port},{port}" for port in range(5001, 5021)), seconds=25)
         self.assertIn("5020/tcp (the router has stopped answering)", events())
+
+    def test_the_record_of_an_earlier_version_is_taken_over(self):
+        for flavour in ("form", "blind"):
+            with self.subTest(flavour=flavour):
+                self.forget()
+                LAB.start_web(flavour)
+                self.saved({("udp", 5003): (BOX, 5003)}, "1,1,udp,5003,5003")
+                os.unlink(RECORD)
+                section = '[{}]\ngateway="{}"\nbox="{}"\nprotocol="udp"\nrouter_first="{}"\nrouter_last="{}"\nbox_first="5003"\nname="tavo:"\n'
+                LAB.write(EARLIER, section.format(1, GATEWAY, BOX, 5003, 5003) + section.format(2, "10.9.9.9", BOX, 7000, 7005))
+                self.saved({})
+                self.assertFalse(os.path.exists(EARLIER))
+                self.assertIn('gateway="10.9.9.9"', LAB.read(RECORD), "what another router has is not forgotten")
+                LAB.write(EARLIER, "no sections\n")
+                self.saved({})
+                self.assertEqual(LAB.read(EARLIER.replace(".made", ".damaged")), "no sections\n")
+                LAB.stop_router()
+
+    def test_a_former_address_and_a_range_in_the_way(self):
+        LAB.start_web("form")
+        self.saved({("tcp", port): (BOX, port) for port in (6001, 6002, 6003)}, "1,1,tcp,6001-6003,6001-6003")
+        former = "192.168.77.44"
+        LAB.write(RECORD, LAB.read(RECORD).replace(f'client="{BOX}"', f'client="{former}"'))
+        LAB.run("router", f"curl -s -X POST -d 'host={former}' http://127.0.0.1:8080/move")
+        self.saved({("tcp", port): (BOX, port) for port in (6001, 6002)}, "1,1,tcp,6001-6002,6001-6002")
+        LAB.save("1,1,tcp,9997-9999,5001-5003", "2,1,udp,9997-9999,5001-5003")
+        why = "the router already forwards this port for something else"
+        self.assertEqual(self.rows()[0], {f"{port}/{protocol}": ("open", "") if protocol == "udp" else ("refused", why)
+                                          for port in (9997, 9998, 9999) for protocol in ("tcp", "udp")})
+        self.assertIn(f"9997-9999/tcp ({why})", events())
+        self.assertIn({"address": LAN2, "description": "tavo:another box"}, [row["holder"] for row in self.rows()[1]["rules"]])
 
     def test_killed_in_the_middle_forgets_nothing(self):
         LAB.start_web("blind", "hangs_after_add")

@@ -78,6 +78,10 @@ class Page(http.server.BaseHTTPRequestHandler):
         COUNT[path] = COUNT.get(path, 0) + 1
         if path == "/state":
             return self.answer(json.dumps({"table": TABLE, "count": COUNT}))
+        if path == "/move":  # the box had another address when its forwards were made
+            for row in TABLE[1:]:
+                row["host"] = urllib.parse.parse_qs(body)["host"][0]
+            return self.answer("")
         if FAULT == "hangs" or (FAULT == "hangs_on_add" and "add" in body):
             return time.sleep(600)
         if FAULT == "endless":

@@ -12,7 +12,7 @@
 #include <set>
 
 // First: its Refusal is a record, the mapping core's a function.
-#include "programs/tavoportforward/Made.h"
+#include "programs/tavoportforward/EarlierRecord.h"
 
 #include "../../cli/TextFile.h"
 #include "disk.h"
@@ -147,17 +147,30 @@ std::string KeptTold() {
     return szOutside.empty() ? kNone : szOutside;
 }
 
-bool KeepJob(uint16_t nPort) {
-    return tavo::MadeJobs("192.168.1.1", kBox).Add({"tcp", nPort, nPort, nPort, "x"});
+constexpr char kPagesFile[] = "/var/lib/tavo/pages_made.conf";
+constexpr char kEarlierFile[] = "/var/lib/tavo/manual_router.made";
+
+// The forwarder's record; until there is one, that of an earlier version.
+std::string KeptJobs() {
+    tavo::MadeFile file(kPagesFile);
+    file.Get().TurnTo({"192.168.1.1", ""});
+    std::string szText;
+    for (const auto& [key, made] : file.Get().Here()) {
+        szText += std::to_string(key.second);
+    }
+    return !szText.empty() ? szText : access(kEarlierFile, F_OK) == 0 ? "earlier" : kNone;
 }
 
-std::string KeptJobs() {
-    const auto rgJobs = tavo::MadeJobs("192.168.1.1", kBox).Here();
-    std::string szText = rgJobs.empty() ? kNone : "";
-    for (const tavo::MadeJob& made : rgJobs) {
-        szText += std::to_string(made.job.nRouterFirst);
-    }
-    return szText;
+bool TakeOverJobs() {
+    tavo::MadeFile file(kPagesFile);
+    tavo::TakeOverEarlierRecord(file);
+    return access(kEarlierFile, F_OK) != 0;
+}
+
+std::string EarlierRow(int nPort) {
+    const std::string szPort = std::to_string(nPort);
+    return "[" + szPort + "]\ngateway=\"192.168.1.1\"\nbox=\"" + kBox + "\"\nprotocol=\"both\"\nrouter_first=\"" +
+           szPort + "\"\nrouter_last=\"" + szPort + "\"\nbox_first=\"" + szPort + "\"\nname=\"x\"\n\n";
 }
 
 std::string KeptTest() {
@@ -286,8 +299,8 @@ const std::vector<Store>& Stores() {
         {"upnpd's record", [] { KeepMade("old"); }, [] { return KeepMade("new"); }, KeptMade, "old", "new"},
         {"upnpd's first record", [] {}, [] { return KeepMade("new"); }, KeptMade, kNone, "new"},
         {"what was told", [] { KeepTold("old"); }, [] { return KeepTold("new"); }, KeptTold, "old", "new", "", true},
-        {"the forwarder's record", [] { KeepJob(1); }, [] { return KeepJob(2); }, KeptJobs, "1", "12"},
-        {"the forwarder's first record", [] {}, [] { return KeepJob(2); }, KeptJobs, kNone, "2"},
+        {"the forwarder's record of an earlier version", [] { Write(kEarlierFile, EarlierRow(1) + EarlierRow(2)); },
+         TakeOverJobs, KeptJobs, "earlier", "12"},
         {"a test's mappings",
          [] {
              tavo::SaveTestRules({{1, 1, true, "old"}});
@@ -470,14 +483,11 @@ INSTANTIATE_TEST_SUITE_P(, EachRouter, testing::Range(size_t{0}, std::size(kRout
 
 // One damaged line costs one row; the only memory of an open port is not thrown away with it.
 TEST_F(PowerCuts, ADamagedRecordKeepsWhatCanBeRead) {
-    for (const uint16_t nPort : {uint16_t{1}, uint16_t{2}, uint16_t{3}}) {
-        EXPECT_TRUE(KeepJob(nPort));
-    }
-    constexpr char kFile[] = "/var/lib/tavo/manual_router.made";
-    std::string szText = Read(kFile);
+    std::string szText = EarlierRow(1) + EarlierRow(2) + EarlierRow(3);
     const size_t nAt = szText.find("box_first=\"2\"");
     ASSERT_NE(nAt, std::string::npos);
-    Write(kFile, szText.replace(nAt, 3, std::string(3, '\0')));
+    Write(kEarlierFile, szText.replace(nAt, 3, std::string(3, '\0')));
+    EXPECT_TRUE(TakeOverJobs()) << "it is put aside";
     EXPECT_EQ(KeptJobs(), "13");
 }
 
