@@ -258,8 +258,11 @@ bool Pass::Intend(const MappingKey& key, const Place& place) {
         pMade->nOtherPort = mapping.nBoxPort;
         return blNews;
     }
+    // What was shown is known by its text from then on. One that the router gives to everybody's stays what it is.
+    const bool blText = pMade != nullptr && pMade->blShown && pMade->szText.starts_with(kOwnPrefix) &&
+                        pMade->szText != mapping.szDescription;
     const bool blNews = pMade == nullptr || pMade->szClient != mAround.szBox || pMade->nBoxPort != mapping.nBoxPort ||
-                        pMade->nMore != mapping.nMore;
+                        pMade->nMore != mapping.nMore || blText;
     mRecord.Here()[key] = RowOf(mapping, false, mAround.fnNow());
     return blNews;
 }
