@@ -57,8 +57,8 @@ protected:
 
     const std::string& Gateway() const { return mSzGateway; }
     const std::string& Box() const { return mSzBox; }
-    // The router in front. The kernel forgets hardware, as when the cable was out; at one address it is asked for it, or
-    // else the same as before.
+    // The router in front. The kernel forgets hardware, as when the cable was out; at one address it is asked for it,
+    // or else the same as before.
     RouterName Front(const std::function<bool()>& fnStop);
     uint32_t WishedLease() const { return mNWishedLease; }
     // What the core needs to know of this box; what it does is logged.
