@@ -5,7 +5,6 @@ Usage: recovery.py [TIMES [WORDS OF A CAUSE]]
 """
 import math
 import os
-import random
 import signal
 import statistics
 import sys
@@ -17,7 +16,6 @@ from homelab import BOX, GATEWAY, sh, wait_for
 
 TIMES = int(sys.argv[1]) if len(sys.argv) > 1 else 20
 ONLY = " ".join(sys.argv[2:])
-FEW = min(TIMES, 3)  # of what takes minutes
 NEW = "192.168.77.5"
 PEACE = 6
 LIMIT = 130  # the regular look comes within two minutes
@@ -68,56 +66,8 @@ def gateway_gone(lab):
     return seconds_until_open(lab)
 
 
-@in_peace
-def cable_out_and_in(lab):
-    """The box's own; the router loses its table meanwhile."""
-    sh("ip -n box link set box0 down")
-    lab.lose_table()
-    time.sleep(1)
-    sh(f"ip -n box link set box0 up && ip -n box route replace default via {GATEWAY}")
-    return seconds_until_open(lab)
-
-
-@in_peace
-def daemon_killed(lab):
-    """It is started again by its watching parent; the table is lost meanwhile."""
-    os.kill(lab.daemon_pid(lab.daemon), signal.SIGKILL)
-    lab.lose_table()
-    return seconds_until_open(lab)
-
-
-@in_peace
-def lost_after_a_save(lab):
-    """Without a word, a second after it: the looks are short then."""
-    lab.save("1,1,tcp,5001,5001")
-    time.sleep(1)
-    lab.lose_table()
-    return seconds_until_open(lab)
-
-
-def lost_in_long_peace(lab):
-    """Without a word, when nothing has happened for long; anywhere between two looks."""
-    time.sleep(10 + 20 + 40 + 80 + random.uniform(0, 120))
-    lab.lose_table()
-    return seconds_until_open(lab)
-
-
-def switched(lab):
-    """From the one daemon to the other and back, by what a save goes by; the time begins with the save."""
-    lab.daemon = "upnpd" if lab.daemon == "natpmpd" else "natpmpd"
-    lab.router_conf(natpmp=lab.daemon == "natpmpd")
-    start = time.monotonic()
-    lab.save("1,1,tcp,5001,5001")
-    seconds_until_open(lab)
-    return time.monotonic() - start
-
-
 CAUSES = (("upnpd", "router restarts, announced", restart, TIMES), ("upnpd", "own address changes", own_address, TIMES),
           ("upnpd", "gateway away and back", gateway_gone, TIMES),
-          ("upnpd", "cable out and in", cable_out_and_in, TIMES), ("upnpd", "daemon killed", daemon_killed, TIMES),
-          ("upnpd", "to natpmpd and back", switched, TIMES),
-          ("upnpd", "lost silently, after a save", lost_after_a_save, TIMES),
-          ("upnpd", "lost silently, in long peace", lost_in_long_peace, FEW),
           ("natpmpd", "router restarts, announced", restart, TIMES))
 
 
