@@ -231,9 +231,14 @@ bool RenameOrLog(const char* szFrom, const char* szTo, int nLine) {
     return false;
 }
 
-Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const RouterConf& conf, ErrorReason* pErr) {
+Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const RouterConf& conf, bool blHeld,
+                   ErrorReason* pErr) {
     RouterDB db(szGwRouterIP);
     if (!SetAccount(writer, conf)) {
+        return Stored::kRefused;
+    }
+    if (!blHeld) {  // what is moved aside could come back while the new settings are tried
+        LogError("%s:%d can not save backup file of '%s'", kEntryFile, __LINE__, kRouterConfBak);
         return Stored::kRefused;
     }
     tavo::lib::OwnerAndMode old(kRouterConf);
@@ -323,10 +328,6 @@ int TLibSetRouterConf(const char* szGwRouterIP, __tag_TAVO_ROUTER_CONF* routerCo
             return FinishStoring(StoreDaemonRouter(writer));
         }
         const tavo::lib::HeldFile held(kRouterConf);
-        if (!held.IsHeld()) {  // what is moved aside could come back while the new settings are tried
-            LogError("%s:%d can not save backup file of '%s'", kEntryFile, __LINE__, kRouterConfBak);
-            return -1;
-        }
-        return FinishStoring(StoreManual(writer, szGwRouterIP, *routerConf, pErr));
+        return FinishStoring(StoreManual(writer, szGwRouterIP, *routerConf, held.IsHeld(), pErr));
     });
 }

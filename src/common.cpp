@@ -434,7 +434,7 @@ std::string UniqueName(const char* szPath, AsideFor enFor) {
         szRandom.erase(0, szRandom.size() - kSuffixSize);
         szName = szPath + Unmistakable(szRandom, enFor == AsideFor::kReport);
     }
-    return szName;
+    return lstat(szName.c_str(), &status) == 0 ? "" : szName;  // none is free: the renaming fails
 }
 
 bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
