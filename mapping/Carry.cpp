@@ -71,6 +71,7 @@ private:
     bool IsOver() { return mGuard.IsOver(); }
     RouterReply Note(RouterReply reply);
     Made* MadeAt(const MappingKey& key);
+    std::optional<Made> RowAt(const MappingKey& key);  // a copy
     Step StepFor(const MappingKey& key, const Place& place);
     void Show(const MappingKey& key, const RouterMapping& entry);
     void LookAtTable();
@@ -128,6 +129,11 @@ RouterReply Pass::Note(RouterReply reply) {
 Made* Pass::MadeAt(const MappingKey& key) {
     const auto it = mRecord.Here().find(key);
     return it == mRecord.Here().end() ? nullptr : &it->second;
+}
+
+std::optional<Made> Pass::RowAt(const MappingKey& key) {
+    const Made* pMade = MadeAt(key);
+    return pMade == nullptr ? std::nullopt : std::optional(*pMade);
 }
 
 Step Pass::StepFor(const MappingKey& key, const Place& place) {
@@ -292,8 +298,7 @@ void Pass::NoteIntents(const std::vector<MappingKey>& rgKeys) {
         const Place& place = mMapPlaces[key];
         const Action enAction = StepFor(key, place).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
-            const Made* pMade = MadeAt(key);
-            std::optional<Made> before = pMade == nullptr ? std::nullopt : std::optional(*pMade);
+            std::optional<Made> before = RowAt(key);
             if (Intend(key, place)) {
                 rgBefore.emplace_back(key, std::move(before));
             }
@@ -417,8 +422,7 @@ bool Pass::Add(const MappingKey& key, Place& place, bool blAnew) {
     }
     RouterMapping mapping = *place.pWanted;
     mapping.szClient = mAround.szBox;
-    const Made* pBefore = MadeAt(key);
-    const std::optional<Made> before = pBefore == nullptr ? std::nullopt : std::optional(*pBefore);
+    const std::optional<Made> before = RowAt(key);
     // What nobody knew before: the router did not answer at first.
     if (blAnew && Intend(key, place) && !mAround.fnSave()) {
         Forgo(key, before);
@@ -495,9 +499,12 @@ void Pass::LookAgain(const MappingKey& key) {
 // Another place that may still have the port of the box, at a router that would take away the one with the other. 0:
 // none.
 uint16_t Pass::OlderPlace(const MappingKey& key, uint16_t nBoxPort) const {
+    if (!mAbilities.blByBoxPort) {
+        return 0;
+    }
     for (const auto& [other, made] : mRecord.Here()) {
         const bool blSame = other.first == key.first && made.nBoxPort == nBoxPort && made.szClient == mAround.szBox;
-        if (mAbilities.blByBoxPort && blSame && other != key) {
+        if (blSame && other != key) {
             return other.second;
         }
     }

@@ -8,8 +8,6 @@
 
 namespace tavo {
 
-namespace {}  // namespace
-
 const std::string& StateFile::Read() {
     mSzWritten = ReadFile(mSzPath, mNMost).value_or("");
     return mSzWritten;

@@ -268,10 +268,6 @@ class Lab:
     def stop_router(self):
         """Without a word to anybody, as when the power goes."""
         self.end(self.router)
-        self.lose_table()
-
-    def lose_table(self):
-        """What the router keeps of its mappings, behind its own daemon's back too."""
         for chain in ("miniupnpd", "prerouting_miniupnpd", "postrouting_miniupnpd"):
             self.run("router", f"nft flush chain inet home {chain}")
 
