@@ -248,7 +248,7 @@ class Lab:
 
     # ---- the real router ----------------------------------------------------------------------------
 
-    def start_router(self, version1=False, port=5000, upnp=True, secure=True):
+    def start_router(self, version1=False, port=5000, upnp=True, secure=True, wait=True):
         self.write("/tmp/miniupnpd.conf", "\n".join((
             "ext_ifname=wan0", f"ext_ip={PUBLIC}", "listening_ip=br0", f"http_port={port}", "enable_natpmp=yes",
             f"enable_upnp={'yes' if upnp else 'no'}", f"secure_mode={'yes' if secure else 'no'}", "upnp_table_name=home", "upnp_nat_table_name=home",
@@ -261,6 +261,8 @@ class Lab:
         self.run("router", "/usr/sbin/miniupnpd -f /tmp/miniupnpd.conf -P /tmp/miniupnpd.pid >/dev/null 2>&1")
         self.router = Detached("/tmp/miniupnpd.pid")
         self.processes.append(self.router)
+        if not wait:
+            return
         wait_for((lambda: self.run("box", f"curl -sf -o /dev/null http://{GATEWAY}:{port}/rootDesc.xml",
                                    check=False).returncode == 0) if upnp else
                  lambda: self.run("router", "ss -Hlun sport = :5351").stdout, 10, "the router is up")
