@@ -110,6 +110,16 @@ bool IsReady(RouterConfWriter& writer, int nLine) {
     return true;
 }
 
+tavo::lib::Holds HoldsOf(const TAVO_PF_CONF* pHead) {
+    for (const TAVO_PF_CONF* pSection = pHead; pSection != nullptr; pSection = pSection->pNext) {
+        const char* szPass = pSection->pHash == nullptr ? nullptr : TLIBCSzHashGetValue(pSection->pHash, "pass");
+        if (szPass != nullptr && *szPass != '\0') {
+            return tavo::lib::Holds::kSecret;
+        }
+    }
+    return tavo::lib::Holds::kNoSecret;
+}
+
 }  // namespace
 
 int RouterConfWriter::SetBrand(const std::string& brand) {
@@ -192,6 +202,7 @@ int RouterConfWriter::Sync() {
         if (IsValid() == 0) {
             return 0;
         }
-        return tavo::lib::ReplaceFile(tavo::lib::kRouterConf, [&] { return TAVOGwRouterConfSet(mPHead) >= 0; }) ? 1 : 0;
+        const auto fnWrite = [&] { return TAVOGwRouterConfSet(mPHead) >= 0; };
+        return tavo::lib::ReplaceFile(tavo::lib::kRouterConf, HoldsOf(mPHead), fnWrite) ? 1 : 0;
     });
 }

@@ -80,7 +80,8 @@ int RouterRuleConfWriter::AddRule(int nId, bool blEnable, const std::string& rou
 
 int RouterRuleConfWriter::Sync() {
     return AtBorder(0, [&] {
-        return tavo::lib::ReplaceFile(tavo::lib::kRuleConf, [&] { return Sync(tavo::lib::kRuleConf) != 0; }) ? 1 : 0;
+        const auto fnWrite = [&] { return Sync(tavo::lib::kRuleConf) != 0; };
+        return tavo::lib::ReplaceFile(tavo::lib::kRuleConf, tavo::lib::Holds::kNoSecret, fnWrite) ? 1 : 0;
     });
 }
 

@@ -40,7 +40,6 @@ constexpr size_t kToolLineSize = 1024;
 constexpr size_t kSuffixSize = 6;
 constexpr int kNameTries = 100;
 constexpr int kHoldTries = 100;
-constexpr useconds_t kHoldMicroseconds = 20000;
 constexpr char kVersionCommand[] = "/usr/tavo/bin/tavoportforward --version";
 constexpr std::string_view kVersionKey = "syntax version";
 
@@ -290,23 +289,24 @@ void FlushDirectoryOf(const char* szPath) {
     }
 }
 
-// A reader, or another program, may have it locked for a moment.
+// What stands there by now may be another file than the one that was opened. A file system may have no locks: readers
+// take every copy for held there.
 HeldFile::HeldFile(const char* szPath) {
     for (int i = 0; i < kHoldTries && !mBlHeld; ++i) {
-        if (i > 0) {
-            usleep(kHoldMicroseconds);
-        }
         Release();
+        struct stat own = {};
         struct stat there = {};
         if (TLIBCFileExist(szPath) != 1 || stat(szPath, &there) != 0) {
             mBlHeld = true;
             return;
         }
-        // What stands there by now may be another file than the one that was opened.
-        struct stat own = {};
         mFd = open(szPath, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-        mBlHeld = mFd >= 0 && flock(mFd, LOCK_EX | LOCK_NB) == 0 && fstat(mFd, &own) == 0 &&
-                  stat(szPath, &there) == 0 && own.st_ino == there.st_ino && own.st_dev == there.st_dev;
+        struct flock whole = {};
+        whole.l_type = F_RDLCK;
+        const bool blLocked =
+            mFd >= 0 && (fcntl(mFd, F_OFD_SETLK, &whole) == 0 || fcntl(mFd, F_OFD_GETLK, &whole) != 0);
+        mBlHeld = blLocked && fstat(mFd, &own) == 0 && stat(szPath, &there) == 0 && own.st_ino == there.st_ino &&
+                  own.st_dev == there.st_dev;
     }
 }
 
@@ -437,7 +437,7 @@ std::string UniqueName(const char* szPath, AsideFor enFor) {
     return lstat(szName.c_str(), &status) == 0 ? "" : szName;  // none is free: the renaming fails
 }
 
-bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
+bool ReplaceFile(const char* szPath, Holds enHolds, const std::function<bool()>& fnWrite) {
     const std::string szAside = UniqueName(szPath, AsideFor::kWriting);
     if (TLIBCFileExist(szPath) == 1 && rename(szPath, szAside.c_str()) != 0) {
         LogError("%s:%d rename(%s, %s) failed ", kFile, __LINE__, szPath, szAside.c_str());
@@ -452,7 +452,11 @@ bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite) {
     }
     if (TLIBCFileExist(szAside.c_str()) == 1) {
         if (blWritten) {
-            OwnerAndMode(szAside.c_str()).GiveTo(szPath);
+            OwnerAndMode old(szAside.c_str());
+            if (enHolds == Holds::kSecret) {
+                old.HideFromOthers();
+            }
+            old.GiveTo(szPath);
             unlink(szAside.c_str());
         } else {
             RenameLogged(szAside.c_str(), szPath, __LINE__);

@@ -125,8 +125,9 @@ private:
 // What was renamed and deleted in the directory of the file at szPath is so after a power cut, too.
 void FlushDirectoryOf(const char* szPath);
 
-// Holds the file at szPath locked, under whatever name it gets meanwhile, as long as the object and the process live:
-// readers bring back what a killed writer set aside, and leave alone what is held. Waits two seconds for it at most.
+// Holds the file at szPath, under whatever name it gets meanwhile, as long as the object and the process live: readers
+// bring back what a killed writer set aside, and leave alone what is held. By a read lock, so that nobody who may only
+// read the file can be in its way.
 class HeldFile {
 public:
     explicit HeldFile(const char* szPath);
@@ -134,8 +135,7 @@ public:
     HeldFile(const HeldFile&) = delete;
     HeldFile& operator=(const HeldFile&) = delete;
 
-    // False: somebody else has it locked, and readers could not tell it from what a killed writer left. Where there is
-    // no file, there is nothing to hold.
+    // False: a reader could take it for what a killed writer left. Where there is no file, there is nothing to hold.
     bool IsHeld() const { return mBlHeld; }
 
 private:
@@ -206,10 +206,13 @@ ConfList NewSection(const std::string& szName, const char* szNoNode, const char*
 enum class AsideFor { kWriting, kReport };
 std::string UniqueName(const char* szPath, AsideFor enFor);
 
+// Whether a file has a secret in it, which anybody could read and is its owner's alone from then on.
+enum class Holds { kNoSecret, kSecret };
+
 // Replaces szPath safely: the live file is renamed to a unique name beside it, fnWrite writes the new
 // one, and the old one is deleted after success (the new one takes its owner and mode) and renamed back
 // after failure. True when fnWrite succeeded; every failure is logged, and what fnWrite throws is one.
-bool ReplaceFile(const char* szPath, const std::function<bool()>& fnWrite);
+bool ReplaceFile(const char* szPath, Holds enHolds, const std::function<bool()>& fnWrite);
 
 // What distinguishes one port-mapping daemon from the other.
 struct DaemonControl {

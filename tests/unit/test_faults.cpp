@@ -352,39 +352,34 @@ TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
         }
     }
     gFnOnConfSet = nullptr;
-    // An older tool, while another program holds the settings locked, as one that reads does.
+}
+
+// Whoever may read the settings may lock them too: he is in the way of nobody who stores or reports. Who may write them
+// can: what cannot be held could be brought back too soon, and be packed with the password in it.
+TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
+    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
     Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
     Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=0'\n");
     chmod("/usr/tavo/bin/tavoportforward", 0755);
-    Write(kRouterConf, kOldSettings);
-    const tavo::Descriptor fdForeign(open(kRouterConf, O_RDONLY | O_CLOEXEC));
-    ASSERT_EQ(flock(fdForeign.Get(), LOCK_SH), 0);
-    CallAndDie({"", "no", 0, false});
-    EXPECT_EQ(Read(kRouterConf), kOldSettings);
-}
-
-// What a report sets aside is held, or not set aside: with a lock of somebody else's on it, a reader would take the
-// report for dead, and the user's own file would be packed.
-TEST_F(Faults, AReportPacksNoPasswordWhoeverHasTheSettingsLocked) {
-    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
-    Write(kRouterConf, kOldSettings);
-    tavo::FileLock foreign(kRouterConf, O_RDONLY);
-    ASSERT_TRUE(foreign.Try(LOCK_SH));
-    const KilledCall report{"", nullptr, 1, false};
-    CallAndDie(report);
-    EXPECT_FALSE(
-        std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); }));
-    EXPECT_EQ(Read(kRouterConf), kOldSettings);
-    EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"}));
-    std::thread release([&] {
-        usleep(100000);
-        foreign.Release();
-    });
-    CallAndDie(report);  // a look that locks for a moment is waited for
-    release.join();
-    EXPECT_TRUE(
-        std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); }));
-    EXPECT_EQ(Read(kRouterConf), kOldSettings);
+    const auto fnIsPacked = [] {
+        return std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); });
+    };
+    for (const char* szLock : {"flock", "read", "write"}) {
+        gLog.clear();
+        Write(kRouterConf, kOldSettings);
+        const bool blWrite = std::string(szLock) == "write";
+        const tavo::Descriptor fdForeign(open(kRouterConf, (blWrite ? O_RDWR : O_RDONLY) | O_CLOEXEC));
+        struct flock lock = {};
+        lock.l_type = blWrite ? F_WRLCK : F_RDLCK;
+        ASSERT_EQ(std::string(szLock) == "flock" ? flock(fdForeign.Get(), LOCK_EX)
+                                                 : fcntl(fdForeign.Get(), F_OFD_SETLK, &lock),
+                  0);
+        CallAndDie({"", nullptr, 1, false});
+        EXPECT_EQ(fnIsPacked(), !blWrite) << szLock;
+        CallAndDie({"settings of a newer syntax are undone", "no", 0, false});
+        EXPECT_EQ(Read(kRouterConf), kOldSettings) << szLock;
+        EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"})) << szLock;
+    }
 }
 
 TEST_F(Faults, WhatAReportSetAsideComesBackUnlessSomebodyHasWrittenSince) {
@@ -426,6 +421,8 @@ TEST_F(Faults, SettingsThatCannotBeReadMakeRoomForThoseOfBefore) {
         bool blCopy;
     } rgCases[] = {{"garbage", [] { Write(kRouterConf, "garbage\n"); }, false},
                    {"garbage and a copy", [] { Write(kRouterConf, "garbage\n"); }, true},
+                   {"nothing but a comment", [] { Write(kRouterConf, "# nothing\n"); }, false},
+                   {"nothing but a comment and a copy", [] { Write(kRouterConf, "# nothing\n"); }, true},
                    {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }, false},
                    {"a link to nowhere and a copy", [] { symlink("/nowhere", kRouterConf); }, true}};
     for (const auto& one : rgCases) {
@@ -551,13 +548,27 @@ TEST_F(Faults, AReplacedFileKeepsOwnerAndMode) {
         {kSystemConf, [] { EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr), 1); }},
     };
     // Settings that anybody could read are their owner's alone once they hold the password of a router's pages.
-    for (const auto& [szSupport, nMode] : {std::pair{"yes", 0644U}, {"no", 0600U}}) {
+    const auto fnSetAccount = [](const char* szPass) {
+        RouterConfWriter writer(true);
+        EXPECT_EQ(writer.SetUserPass("me", szPass) + writer.Sync(), 2);
+    };
+    const std::pair<unsigned, std::function<void()>> rgModes[] = {{0644,
+                                                                   [] {
+                                                                       CallAndDie({"", "yes", 1, true});
+                                                                   }},
+                                                                  {0600,
+                                                                   [] {
+                                                                       CallAndDie({"", "no", 1, true});
+                                                                   }},
+                                                                  {0644, [&] { fnSetAccount(""); }},
+                                                                  {0600, [&] { fnSetAccount("secret"); }}};
+    for (const auto& [nMode, fnStore] : rgModes) {
         Write(kRouterConf, "");
         chmod(kRouterConf, 0644);
-        CallAndDie({"", szSupport, 1, true});
+        fnStore();
         struct stat status = {};
         stat(kRouterConf, &status);
-        EXPECT_EQ(status.st_mode & 07777U, nMode) << szSupport;
+        EXPECT_EQ(status.st_mode & 07777U, nMode) << Read(kRouterConf);
     }
     for (const auto& write : rgWrites) {
         SCOPED_TRACE(write.szFile);

@@ -2,6 +2,7 @@
 // Promises: see Aside.h.
 #include "portforward/Aside.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -13,8 +14,8 @@
 #include <string_view>
 #include <vector>
 
+#include "ground/Descriptor.h"
 #include "ground/Directory.h"
-#include "ground/FileLock.h"
 #include "ground/Rename.h"
 #include "ground/Suffix.h"
 #include "ground/SysLog.h"
@@ -78,10 +79,13 @@ bool IsOlder(const timespec& one, const timespec& other) {
     return one.tv_sec != other.tv_sec ? one.tv_sec < other.tv_sec : one.tv_nsec < other.tv_nsec;
 }
 
-// Whether the process lives that set the copy aside and wants it back itself: it holds it locked. Two who look at once
-// do not take each other for it.
+// Whether the process lives that set the copy aside and wants it back itself: it has a lock on it. Those who only look
+// are in nobody's way.
 bool IsHeld(const AsideCopy& copy) {
-    return !FileLock(copy.szPath, O_RDONLY).Try(LOCK_SH);
+    const Descriptor fd(open(copy.szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+    struct flock other = {};
+    other.l_type = F_WRLCK;
+    return fd.Get() < 0 || fcntl(fd.Get(), F_OFD_GETLK, &other) != 0 || other.l_type != F_UNLCK;
 }
 
 // Whether one copy has less to say than the other; what is half written has nothing.
