@@ -66,6 +66,13 @@ std::string MappingName(const RouterMapping& mapping) {
     return std::to_string(mapping.nRouterPort) + szLast + szProtocol;
 }
 
+Verdict RefusedBy(const RouterReply& reply) {
+    const PortState enState = reply.IsRefusal() ? PortState::kRefused
+                              : reply.IsOk()    ? PortState::kWaiting
+                                                : PortState::kUnknown;
+    return {enState, reply.IsOk() ? "stopped" : reply.szWord};
+}
+
 Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
     return {MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort};
 }

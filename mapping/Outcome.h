@@ -68,6 +68,8 @@ inline constexpr char kUnrecorded[] = "unrecorded";
 
 // "5000/tcp", or "5000-5010/both", as a user reads it.
 std::string MappingName(const RouterMapping& mapping);
+// Of a mapping that is not there, as the router has it. kOk: it was not asked for.
+Verdict RefusedBy(const RouterReply& reply);
 // What became of a mapping.
 Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict);
 

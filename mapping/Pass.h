@@ -1,15 +1,39 @@
-// One pass over the wanted mappings: what came of it, and when it has to end. Relies on nothing.
+// One pass over the wanted mappings: what it is given, what came of it, and when it has to end. Relies on nothing.
 // Promises: a pass is over well before a save stops waiting for it, whatever the router does.
 #pragma once
 
 #include <cstdint>
 #include <functional>
+#include <map>
+#include <string>
+#include <utility>
 
 #include "ground/BootClock.h"
 #include "mapping/Outcome.h"
+#include "mapping/Plan.h"
+#include "mapping/Record.h"
 #include "mapping/Router.h"
 
 namespace tavo {
+
+// What was learnt about one router, kept between passes.
+struct Habits {
+    uint32_t nLease = 3600;        // seconds to ask for
+    bool blPermanentOnly = false;  // it refuses leases
+    // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
+    // are not asked for again while they stand here.
+    std::map<MappingKey, std::string> mapElsewhere = {};
+    MappingKey next = {};  // where to go on, after a pass that its time was too short for
+};
+
+struct Surroundings {
+    std::string szBox;               // the box's own address
+    std::function<int64_t()> fnNow;  // seconds of boot time
+    std::function<bool()> fnStop;
+    std::function<bool()> fnSave;  // puts the record where it survives us; whether it is there
+    // Is told of each step that changes something at the router, and why.
+    std::function<void(const RouterMapping&, const Step&)> fnTell = [](const RouterMapping&, const Step&) {};
+};
 
 struct PassResult {
     OutcomeList rgOutcomes;  // those of the wanted mappings first, in their order
@@ -33,10 +57,19 @@ public:
     // Counts answers that did not come; after a few in a row the pass is over.
     RouterReply Note(RouterReply reply) {
         mNSilent = reply.IsSilence() ? mNSilent + 1 : 0;
+        mBlSense =
+            mBlSense || reply.IsOk() || reply.enReply == Reply::kNoSuchEntry || reply.enReply == Reply::kConflict;
         if (mNSilent >= kTransportTries || reply.enReply == Reply::kUnreachable) {
             mResult.transport = reply;
         }
         return reply;
+    }
+    // Whether the router has answered at least one question with sense.
+    bool HasSense() const { return mBlSense; }
+    // What there is to say of what the router was not asked about any more.
+    RouterReply Unasked() const {
+        const bool blLate = mResult.transport.IsOk() && !mResult.blStopped;
+        return blLate ? RouterReply{Reply::kTimeout, "timeout"} : mResult.transport;
     }
 
 private:
@@ -48,6 +81,7 @@ private:
     std::function<int64_t()> mFnNow;
     int64_t mNEnd;
     int mNSilent = 0;
+    bool mBlSense = false;
 };
 
 }  // namespace tavo

@@ -24,6 +24,16 @@ Number NumberIn(const std::string& szText) {
 
 }  // namespace
 
+Made RowOf(const RouterMapping& mapping, bool blShown, int64_t nAsked) {
+    Made made{mapping.szClient, mapping.nBoxPort, mapping.szDescription, blShown, mapping.nLease, nAsked};
+    made.nMore = mapping.nMore;
+    return made;
+}
+
+RouterMapping MappingOf(const MappingKey& key, const Made& made, uint32_t nLeft) {
+    return {key.first, key.second, made.nBoxPort, made.szClient, made.szText, nLeft, true, made.nMore};
+}
+
 Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(szBoot)) {
     bool blThisBoot = false;
     for (const Section& section : ReadableSections(szText)) {

@@ -69,6 +69,10 @@ struct Made {
     static constexpr int64_t kSurely = 60;  // seconds after its end until a lease is believed to have ended
 };
 
+// What goes on record of a mapping that was asked for at that time; and back, with so many seconds of its lease left.
+Made RowOf(const RouterMapping& mapping, bool blShown, int64_t nAsked);
+RouterMapping MappingOf(const MappingKey& key, const Made& made, uint32_t nLeft);
+
 class Record {
 public:
     using Rows = std::map<MappingKey, Made>;

@@ -1,0 +1,77 @@
+// See Intents.h.
+#include "mapping/Intents.h"
+
+#include <optional>
+#include <utility>
+
+#include "ground/Marks.h"
+
+namespace tavo {
+
+namespace {
+
+// True when it is news.
+bool Intend(Places& places, const Place& place) {
+    Made* pMade = places.MadeAt(place);
+    RouterMapping mapping = *place.pWanted;
+    mapping.szClient = places.around.szBox;
+    mapping.nLease = places.habit.blPermanentOnly ? 0 : places.habit.nLease;
+    if (pMade != nullptr && place.enSeen == Seen::kPresent) {  // a change: it may lead to the one port or to the other
+        const bool blNews = pMade->blShown || pMade->nOtherPort != mapping.nBoxPort;
+        pMade->blShown = false;
+        pMade->nOtherPort = mapping.nBoxPort;
+        return blNews;
+    }
+    // What was shown is known by its text from then on. One that the router gives to everybody's stays what it is.
+    const bool blText = pMade != nullptr && pMade->blShown && pMade->szText.starts_with(kOwnPrefix) &&
+                        pMade->szText != mapping.szDescription;
+    const bool blNews = pMade == nullptr || pMade->szClient != mapping.szClient ||
+                        pMade->nBoxPort != mapping.nBoxPort || pMade->nMore != mapping.nMore || blText;
+    places.rows[place.key] = RowOf(mapping, false, places.Now());
+    return blNews;
+}
+
+void Put(Places& places, const PlaceList& rgpAsked, bool blNews) {
+    std::vector<std::pair<Place*, std::optional<Made>>> rgBefore;
+    for (Place* pPlace : rgpAsked) {
+        const Made* pMade = places.MadeAt(*pPlace);
+        std::optional<Made> before = pMade == nullptr ? std::nullopt : std::optional(*pMade);
+        if (Intend(places, *pPlace)) {
+            rgBefore.emplace_back(pPlace, std::move(before));
+        }
+    }
+    if ((!blNews && rgBefore.empty()) || places.around.fnSave()) {
+        return;
+    }
+    for (const auto& [pPlace, before] : rgBefore) {
+        places.rows.erase(pPlace->key);
+        if (before) {
+            places.rows.emplace(pPlace->key, *before);
+        }
+        pPlace->blUnrecorded = true;
+    }
+}
+
+}  // namespace
+
+void NoteIntents(Places& places, const PlaceList& rgpPlaces) {
+    PlaceList rgpAsked;
+    bool blNews = false;
+    for (Place* pPlace : rgpPlaces) {
+        const Action enAction = places.StepFor(*pPlace).enAction;
+        if (enAction == Action::kAdd || enAction == Action::kChange) {
+            rgpAsked.push_back(pPlace);
+        } else if (enAction == Action::kRenew && places.MadeAt(*pPlace) == nullptr) {  // made before there was a record
+            places.rows[pPlace->key] = RowOf(pPlace->entry, true, 0);
+            places.rows[pPlace->key].blBefore = true;
+            blNews = true;
+        }
+    }
+    Put(places, rgpAsked, blNews);
+}
+
+void NoteIntent(Places& places, Place& place) {
+    Put(places, {&place}, false);
+}
+
+}  // namespace tavo

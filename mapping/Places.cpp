@@ -1,0 +1,158 @@
+// See Places.h.
+#include "mapping/Places.h"
+
+#include <algorithm>
+#include <iterator>
+
+#include "ground/Marks.h"
+
+namespace tavo {
+
+namespace {
+
+constexpr int64_t kLookFor = 20;  // seconds; then what was looked at is done
+constexpr int kRangeFrom = 4;     // fewer are asked for one by one
+// Of one request. A widespread router daemon dies of a range with more than some hundred and thirty entries.
+constexpr int kRangePorts = 64;
+
+}  // namespace
+
+Places::Places(Router& aRouter, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& aHabit,
+               const Surroundings& surroundings)
+    : router(aRouter),
+      what(aRouter.What()),
+      rows(record.Here()),
+      habit(aHabit),
+      around(surroundings),
+      guard(result, around.fnStop, around.fnNow) {
+    for (const RouterMapping& wanted : rgWanted) {
+        Place& place = At(KeyOf(wanted));
+        place.pWanted = place.pWanted == nullptr ? &wanted : place.pWanted;
+    }
+    for (const auto& [key, made] : rows) {
+        At(key);
+    }
+}
+
+Place& Places::At(const MappingKey& key) {
+    return mapPlaces.try_emplace(key, Place{.key = key}).first->second;
+}
+
+Made* Places::MadeAt(const Place& place) {
+    const auto it = rows.find(place.key);
+    return it == rows.end() ? nullptr : &it->second;
+}
+
+Step Places::StepFor(const Place& place) {
+    const PlaceView view{place.pWanted, place.enSeen, place.enSeen == Seen::kPresent ? &place.entry : nullptr,
+                         MadeAt(place)};
+    return Decide(view, around.szBox, Now(), what);
+}
+
+bool Places::IsServed(const Place& place) const {
+    return place.enSeen == Seen::kPresent && Serves(place.entry, *place.pWanted, around.szBox);
+}
+
+RouterMapping Places::Known(const Place& place) {
+    const Made* pMade = MadeAt(place);
+    if (pMade == nullptr || (place.enSeen == Seen::kPresent && !place.entry.szProtocol.empty())) {
+        return place.entry;
+    }
+    const auto nLeft = static_cast<uint32_t>(std::clamp<int64_t>(pMade->End() - Now(), 0, UINT32_MAX));
+    return MappingOf(place.key, *pMade, nLeft);
+}
+
+// What a table does not show may be there: it is read entry by entry, and whatever others take away or make meanwhile
+// moves those that follow.
+void Places::LookAtTable() {
+    std::vector<RouterMapping> rgTable;
+    const RouterReply reply = guard.Note(router.List(rgTable));
+    if (!what.blShows) {
+        result.transport = reply.IsSilence() ? reply : result.transport;
+        Recall();
+        return;
+    }
+    for (const RouterMapping& entry : rgTable) {
+        Show(entry, At(KeyOf(entry)));
+    }
+}
+
+// A router that shows nothing: what it has granted, and what has not run out since, is what there is while it answers.
+// Where it was not asked for anything, nothing of ours is.
+void Places::Recall() {
+    for (auto& [key, place] : mapPlaces) {
+        const Made* pMade = MadeAt(place);
+        const bool blThere = pMade != nullptr && pMade->blShown && Now() < pMade->End();
+        place.enSeen = blThere ? Seen::kPresent : pMade == nullptr ? Seen::kAbsent : Seen::kHidden;
+        if (blThere) {
+            place.entry = Known(place);
+        }
+    }
+}
+
+void Places::Show(const RouterMapping& entry, Place& place) {
+    place.enSeen = Seen::kPresent;
+    place.entry = entry;
+    Made* pMade = KeyOf(entry) == place.key ? MadeAt(place) : nullptr;
+    // Whom it is for where the router does not show that: for whom we made it, unless its text is somebody else's.
+    if (pMade != nullptr && entry.szClient.empty() &&
+        (entry.szDescription.empty() || entry.szDescription.starts_with(kOwnPrefix))) {
+        place.entry.szClient = pMade->szClient;
+    }
+    if (pMade == nullptr || !pMade->IsEntry(place.entry)) {
+        return;
+    }
+    pMade->szText = entry.szDescription;
+    pMade->nBoxPort = entry.nBoxPort;
+    pMade->nOtherPort = 0;
+    // How long a lease is shows right after it was granted; later listings show what is left of it, or nothing new.
+    if (place.blWritten || !pMade->blShown) {
+        pMade->nLease = pMade->nLease == 0 ? entry.nLease : std::min(pMade->nLease, entry.nLease);
+    }
+    pMade->blShown = true;
+}
+
+RouterReply Places::Look(Place& place) {
+    RouterMapping entry;
+    RouterReply reply = guard.Note(router.Get(place.key.first, place.key.second, entry));
+    if (reply.IsOk()) {
+        Show(entry, place);
+    } else if (reply.IsRefusal()) {
+        place.enSeen = reply.enReply == Reply::kNoSuchEntry ? Seen::kAbsent : Seen::kHidden;
+    }
+    return reply;
+}
+
+void Places::LookAt(PlaceList& rgpPlaces) {
+    const int64_t nEnd = Now() + kLookFor;
+    size_t nLooked = 0;
+    for (; nLooked < rgpPlaces.size() && (nLooked == 0 || Now() <= nEnd); ++nLooked) {
+        if (!guard.IsOver() && StepFor(*rgpPlaces[nLooked]).enAction == Action::kLook) {
+            Look(*rgpPlaces[nLooked]);
+        }
+    }
+    rgpPlaces.resize(nLooked);
+}
+
+void Places::LookAtRanges(PlaceList rgpPlaces) {
+    std::sort(rgpPlaces.begin(), rgpPlaces.end(),
+              [](const Place* pOne, const Place* pOther) { return pOne->key < pOther->key; });
+    bool blShows = true;
+    for (auto it = rgpPlaces.begin(); it != rgpPlaces.end() && blShows && !guard.IsOver();) {
+        const MappingKey& first = (*it)->key;
+        const auto end = std::find_if(it, rgpPlaces.end(), [&](const Place* pPlace) {
+            return pPlace->key.first != first.first || pPlace->key.second - first.second >= kRangePorts;
+        });
+        if (end - it >= kRangeFrom) {
+            const uint16_t nLast = (*std::prev(end))->key.second;
+            std::vector<RouterMapping> rgShown;
+            blShows = guard.Note(router.ListRange(first.first, first.second, nLast, rgShown)).IsOk();
+            for (const RouterMapping& entry : rgShown) {
+                Show(entry, At(KeyOf(entry)));
+            }
+        }
+        it = end;
+    }
+}
+
+}  // namespace tavo
