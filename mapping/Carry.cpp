@@ -4,6 +4,7 @@
 #include "mapping/Carry.h"
 
 #include <algorithm>
+#include <map>
 #include <utility>
 
 #include "mapping/Intents.h"
@@ -57,6 +58,8 @@ private:
     PlaceList mRgpWritten;  // to be read back
     RouterReply mApplied;   // whether what was done has taken effect
     int64_t mNReadBack = 0;
+    // What was on record at first, where the router has one place for each port of the box: by protocol and that port.
+    std::multimap<std::pair<std::string, uint16_t>, const Place*> mMapByBoxPort;
 };
 
 // True when it is gone.
@@ -319,17 +322,13 @@ void Carrier::LookAgain(Place& place) {
 // Another place that may still have the port of the box, at a router that would take away the one with the other. 0:
 // none.
 uint16_t Carrier::OlderPlace(const Place& place) const {
-    if (!mPlaces.what.blByBoxPort) {
-        return 0;
-    }
-    for (const auto& [other, made] : mPlaces.rows) {
-        const bool blSame =
-            other.first == place.key.first && made.nBoxPort == place.pWanted->nBoxPort && made.szClient == Box();
-        if (blSame && other != place.key) {
-            return other.second;
-        }
-    }
-    return 0;
+    const auto [first, end] = mMapByBoxPort.equal_range({place.key.first, place.pWanted->nBoxPort});
+    const auto older = std::find_if(first, end, [&](const auto& row) {
+        const Made* pMade = mPlaces.MadeAt(*row.second);  // as it is by now
+        return row.second != &place && pMade != nullptr && pMade->nBoxPort == row.first.second &&
+               pMade->szClient == Box();
+    });
+    return older == end ? uint16_t{0} : older->second->key.second;
 }
 
 // A router's yes is not enough: the mapping must be in its table, and be ours.
@@ -384,11 +383,16 @@ PassResult Carrier::Run(const std::vector<RouterMapping>& rgWanted) {
         if (place.pWanted == nullptr) {
             rgpUnwanted.push_back(&place);
         }
+        if (const Made* pMade = mPlaces.MadeAt(place); mPlaces.what.blByBoxPort && pMade != nullptr) {
+            mMapByBoxPort.emplace(std::pair(key.first, pMade->nBoxPort), &place);
+        }
     }
     Clear(std::move(rgpUnwanted));
     PlaceList rgpWanted;
     for (const RouterMapping& wanted : rgWanted) {
-        rgpWanted.push_back(&mPlaces.At(KeyOf(wanted)));
+        if (Place& place = mPlaces.At(KeyOf(wanted)); place.pWanted != nullptr) {
+            rgpWanted.push_back(&place);
+        }
     }
     BringAll(std::move(rgpWanted));
     PassResult result = Conclude(mPlaces, rgWanted, mApplied);

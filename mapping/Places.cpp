@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <iterator>
+#include <set>
 
 #include "ground/Marks.h"
 
@@ -14,6 +15,8 @@ constexpr int64_t kLookFor = 20;  // seconds; then what was looked at is done
 constexpr int kRangeFrom = 4;     // fewer are asked for one by one
 // Of one request. A widespread router daemon dies of a range with more than some hundred and thirty entries.
 constexpr int kRangePorts = 64;
+// Asking for a second place would be answered with the first, and giving that back would end it.
+constexpr char kShared[] = "another rule has this port of the box; the router gives it one router port only";
 
 }  // namespace
 
@@ -25,9 +28,14 @@ Places::Places(Router& aRouter, const std::vector<RouterMapping>& rgWanted, Reco
       habit(aHabit),
       around(surroundings),
       guard(result, around.fnStop, around.fnNow) {
+    std::set<std::pair<std::string, uint16_t>> setBoxPorts;  // the first rule that asks for one has it
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = At(KeyOf(wanted));
-        place.pWanted = place.pWanted == nullptr ? &wanted : place.pWanted;
+        if (what.blByBoxPort && !setBoxPorts.emplace(wanted.szProtocol, wanted.nBoxPort).second) {
+            place.verdict = {PortState::kRefused, kShared};
+        } else if (place.pWanted == nullptr) {
+            place.pWanted = &wanted;
+        }
     }
     for (const auto& [key, made] : rows) {
         At(key);

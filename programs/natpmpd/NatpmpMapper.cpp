@@ -23,9 +23,6 @@ constexpr DaemonNames kNames{"natpmpd",
 constexpr std::pair<std::string_view, const char*> kCommonWords[] = {
     {"nogateway", "no gateway"}, {"busy", "upnpd has not taken its mappings away yet"}};
 
-// A gateway keeps one mapping for each port of the box and ends it by that port. Asking for a second one
-// would be answered with the first, and giving that back would end it.
-constexpr char kShared[] = "another rule has this port of the box; NAT-PMP gives it one router port only";
 constexpr size_t kMostRouters = 16;  // whose clocks are kept
 constexpr int kYoungAgain = 10;      // seconds until a gateway that has just started is asked once more
 constexpr char kMadeFile[] = "/var/lib/tavo/natpmp_made.conf";
@@ -93,34 +90,19 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
         mMade.Save();
         return {};
     }
-    std::vector<RouterMapping> rgAsked;
-    std::map<std::pair<std::string, uint16_t>, size_t> mapBoxPorts;
-    for (const RouterMapping& wanted : rgWanted) {  // the first rule that asks for a port of the box has it
-        if (mapBoxPorts.emplace(std::pair(wanted.szProtocol, wanted.nBoxPort), rgAsked.size()).second) {
-            rgAsked.push_back(wanted);
-        }
-    }
     NatpmpRouter router(Gateway(), Box(), *mPEpoch, fnStop);
     router.AskAddress(mSzOutside);
     Forget(blRequested);
     mHabit.nLease = WishedLease();
-    const auto fnPass = [&] { return BringInLine(router, rgAsked, record, mHabit, Around(fnStop, mMade)); };
+    const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, Around(fnStop, mMade)); };
     PassResult result = fnPass();
     if (mPEpoch->TakeRestart()) {  // it restarted while we spoke
         record.Lose(Box());
         result = fnPass();
     }
-    for (size_t i = 0, nAsked = 0; i < rgWanted.size(); ++i) {
-        if (nAsked < rgAsked.size() && KeyOf(rgAsked[nAsked]) == KeyOf(rgWanted[i])) {
-            ++nAsked;
-        } else {
-            result.rgOutcomes.insert(result.rgOutcomes.begin() + static_cast<std::ptrdiff_t>(i),
-                                     OutcomeOf(rgWanted[i], {PortState::kRefused, kShared}));
-        }
-    }
     const bool blYoung = result.transport.IsOk() && mPEpoch->IsYoung();
     mBlDoubtful = !result.transport.IsOk() || blYoung;
-    if (blYoung && !rgAsked.empty()) {
+    if (blYoung && !rgWanted.empty()) {
         result.nNextSeconds = kYoungAgain;
     }
     result.enRouter = StateOf(result.transport.enReply);
