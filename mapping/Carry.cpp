@@ -402,6 +402,18 @@ PassResult Carrier::Run(const std::vector<RouterMapping>& rgWanted) {
 
 }  // namespace
 
+void Forget(Record& record, Habits& habit, const std::string& szBox, bool blRestarted, bool blDoubtful, int64_t nNow) {
+    if (blRestarted) {
+        record.Lose(szBox);
+    } else if (blDoubtful) {
+        record.Doubt();
+    }
+    if (blDoubtful || nNow - habit.nElsewhereSince > habit.nLease / 2) {
+        habit.mapElsewhere.clear();
+        habit.nElsewhereSince = nNow;
+    }
+}
+
 // Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
 RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) {
     const RouterMapping wanted = mapping;
@@ -421,6 +433,27 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
                        const Surroundings& around) {
     Places places(router, rgWanted, record, habit, around);
     return Carrier(places).Run(rgWanted);
+}
+
+OutcomeList LeftOnRecord(const Record& record, const std::vector<RouterMapping>& rgWanted, const Abilities& what,
+                         const RouterReply& why, int64_t nNow) {
+    std::map<MappingKey, const RouterMapping*> mapWanted;
+    for (const RouterMapping& wanted : rgWanted) {
+        mapWanted.emplace(KeyOf(wanted), &wanted);
+    }
+    OutcomeList rgOutcomes;
+    for (const auto& [key, made] : record.Here()) {
+        const auto it = mapWanted.find(key);
+        // What a form still has of before is there beside what is wanted.
+        const bool blWanted =
+            it != mapWanted.end() &&
+            (!what.blForm || (it->second->nBoxPort == made.nBoxPort && it->second->nMore == made.nMore));
+        if (!blWanted && !made.IsSurelyOver(nNow, what.blLeases)) {
+            rgOutcomes.push_back(OutcomeOf(MappingOf(key, made, 0), RefusedBy(why)));
+            rgOutcomes.back().blLeftOver = true;
+        }
+    }
+    return rgOutcomes;
 }
 
 }  // namespace tavo

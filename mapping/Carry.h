@@ -6,11 +6,16 @@
 // answers true or the limit has passed.
 #pragma once
 
+#include <string>
 #include <vector>
 
 #include "mapping/Pass.h"
 
 namespace tavo {
+
+// Of what a router granted that shows nothing, before it is asked: drops what no longer counts. blRestarted: it has
+// lost all that it had; blDoubtful: it may have.
+void Forget(Record& record, Habits& habit, const std::string& szBox, bool blRestarted, bool blDoubtful, int64_t nNow);
 
 // Asks for one mapping, with its client set and the lease that the router is known to take; mapping.nLease is what it
 // was given.
@@ -19,5 +24,10 @@ RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit);
 // rgWanted: with client addresses unset. The result says when the next pass is due.
 PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& habit,
                        const Surroundings& around);
+
+// What is on record, wanted by no rule, and may be there still: for a router that cannot be asked for anything, and
+// why.
+OutcomeList LeftOnRecord(const Record& record, const std::vector<RouterMapping>& rgWanted, const Abilities& what,
+                         const RouterReply& why, int64_t nNow);
 
 }  // namespace tavo

@@ -23,7 +23,8 @@ struct Habits {
     // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
     // are not asked for again while they stand here.
     std::map<MappingKey, std::string> mapElsewhere = {};
-    MappingKey next = {};  // where to go on, after a pass that its time was too short for
+    int64_t nElsewhereSince = 0;  // seconds of boot time: none of them is older
+    MappingKey next = {};         // where to go on, after a pass that its time was too short for
 };
 
 struct Surroundings {

@@ -59,23 +59,6 @@ bool NatpmpMapper::OnWake() {
     return blRestart;
 }
 
-// What no longer counts of what the gateway granted. A request has every mapping asked for again, because the gateway
-// cannot be asked what it has.
-void NatpmpMapper::Forget(bool blRequested) {
-    const auto now = BootClock::now();
-    const bool blDoubtful = blRequested || mBlDoubtful;
-    if (mPEpoch->TakeRestart()) {
-        SysLog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
-        mMade.Get().Lose(Box());
-    } else if (blDoubtful) {
-        mMade.Get().Doubt();
-    }
-    if (blDoubtful || now - mAskedElsewhere > std::chrono::seconds(WishedLease() / 2)) {
-        mHabit.mapElsewhere.clear();
-        mAskedElsewhere = now;
-    }
-}
-
 PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                              const std::function<bool()>& fnStop) {
     Record& record = mMade.Get();
@@ -92,8 +75,13 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
     }
     NatpmpRouter router(Gateway(), Box(), *mPEpoch, fnStop);
     router.AskAddress(mSzOutside);
-    Forget(blRequested);
+    const bool blRestarted = mPEpoch->TakeRestart();
+    if (blRestarted) {
+        SysLog(LOG_NOTICE, "the router has restarted; every mapping is asked for again");
+    }
     mHabit.nLease = WishedLease();
+    // The gateway cannot be asked what it has: a request has every mapping asked for again.
+    Forget(record, mHabit, Box(), blRestarted, blRequested || mBlDoubtful, BootSeconds());
     const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, Around(fnStop, mMade)); };
     PassResult result = fnPass();
     if (mPEpoch->TakeRestart()) {  // it restarted while we spoke

@@ -31,12 +31,9 @@ private:
     std::string Outside(const std::function<bool()>& fnStop) override;
     void NewGateway() override;
 
-    void Forget(bool blRequested);
-
     GatewayAnnouncements mAnnounced;
     MadeFile mMade;
     Habits mHabit;
-    BootClock::time_point mAskedElsewhere;         // since then, mHabit.mapElsewhere has grown
     std::map<std::string, EpochWatch> mMapEpochs;  // by what names a router
     EpochWatch* mPEpoch = nullptr;                 // of the one in front; null before the first pass there
     bool mBlDoubtful = false;  // the gateway did not answer the last time, or had just started: it may have begun anew

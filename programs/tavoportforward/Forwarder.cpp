@@ -1,8 +1,6 @@
 // See Forwarder.h.
 #include "programs/tavoportforward/Forwarder.h"
 
-#include <algorithm>
-
 #include "ground/BootClock.h"
 #include "ground/net/Neighbour.h"
 #include "mapping/Carry.h"
@@ -19,6 +17,14 @@ std::string WhyNot(const Verdict& verdict) {
                                            : verdict.szWord;
 }
 
+std::vector<RouterMapping> MappingsOf(const std::vector<Job>& rgJobs) {
+    std::vector<RouterMapping> rgMappings;
+    for (const Job& job : rgJobs) {
+        rgMappings.push_back(job.mapping);
+    }
+    return rgMappings;
+}
+
 }  // namespace
 
 std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vector<Job>& rgWanted) {
@@ -32,41 +38,29 @@ std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vec
         return mRgRefusals;
     }
     RefuseAll(rgWanted, login);
-    for (const auto& [key, made] : record.Here()) {
-        const RouterMapping mapping{key.first, key.second, made.nBoxPort, "", "", 0, true, made.nMore};
-        if (std::none_of(rgWanted.begin(), rgWanted.end(),
-                         [&](const Job& job) { return IsSame(job.mapping, mapping); })) {
-            mRgRefusals.push_back(
-                {MappingName(mapping), login.szWhy, {}, RefusalKind::kRemoval, login.enEnd == WebEnd::kAnswered});
-        }
+    for (const Outcome& left :
+         LeftOnRecord(record, MappingsOf(rgWanted), mRouter.What(), ReplyOf(login), BootSeconds())) {
+        Refuse(left, {}, RefusalKind::kRemoval);
     }
     return mRgRefusals;
 }
 
 void Forwarder::Bring(const std::vector<Job>& rgWanted) {
-    std::vector<RouterMapping> rgMappings;
-    if (!mRouter.List(rgMappings).IsOk()) {
+    std::vector<RouterMapping> rgListed;
+    if (!mRouter.List(rgListed).IsOk()) {
         RefuseRun("list of forwards", mRouter.Listing());
         RefuseAll(rgWanted, mRouter.Listing());
         return;
     }
-    rgMappings.clear();
-    for (const Job& job : rgWanted) {
-        rgMappings.push_back(job.mapping);
-    }
     Habits habit{.nLease = 0, .blPermanentOnly = true};
-    const PassResult result = BringInLine(mRouter, rgMappings, mMade.Get(), habit,
+    const PassResult result = BringInLine(mRouter, MappingsOf(rgWanted), mMade.Get(), habit,
                                           {mSzBox, BootSeconds, [] { return false; }, [this] { return mMade.Save(); }});
-    const auto fnRefuse = [this](const Outcome& outcome, const Job& job, RefusalKind enKind) {
-        mRgRefusals.push_back({outcome.szName, WhyNot(outcome.verdict), job, enKind,
-                               outcome.verdict.enState != PortState::kUnknown, outcome.verdict.holder});
-    };
     for (size_t i = rgWanted.size(); i < result.rgOutcomes.size(); ++i) {  // what is left over
-        fnRefuse(result.rgOutcomes[i], {}, RefusalKind::kRemoval);
+        Refuse(result.rgOutcomes[i], {}, RefusalKind::kRemoval);
     }
     for (size_t i = 0; i < rgWanted.size(); ++i) {
         if (result.rgOutcomes[i].verdict.enState != PortState::kOpen) {
-            fnRefuse(result.rgOutcomes[i], rgWanted[i], RefusalKind::kForward);
+            Refuse(result.rgOutcomes[i], rgWanted[i], RefusalKind::kForward);
         }
     }
     if (!mRouter.Applying().blDone && rgWanted.empty()) {
@@ -75,6 +69,11 @@ void Forwarder::Bring(const std::vector<Job>& rgWanted) {
     if (!mRouter.Listing().blDone) {
         RefuseRun("list of forwards", mRouter.Listing());
     }
+}
+
+void Forwarder::Refuse(const Outcome& outcome, const Job& job, RefusalKind enKind) {
+    const bool blAnswered = outcome.verdict.enState != PortState::kUnknown;
+    mRgRefusals.push_back({outcome.szName, WhyNot(outcome.verdict), job, enKind, blAnswered, outcome.verdict.holder});
 }
 
 // Before anything was changed: what an earlier run made may be there still.

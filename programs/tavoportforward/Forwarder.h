@@ -22,6 +22,7 @@ public:
 
 private:
     void Bring(const std::vector<Job>& rgWanted);
+    void Refuse(const Outcome& outcome, const Job& job, RefusalKind enKind);
     void RefuseAll(const std::vector<Job>& rgWanted, const StepResult& result);
     void RefuseRun(const char* szWhat, const StepResult& result);
 

@@ -30,6 +30,8 @@ uint16_t Port(const Captures& captures, const char* szName, uint16_t nDefault) {
     return nPort != 0 ? nPort : nDefault;
 }
 
+}  // namespace
+
 RouterReply ReplyOf(const StepResult& result) {
     const Reply enReply = result.enEnd == WebEnd::kAnswered      ? Reply::kRefused
                           : result.enEnd == WebEnd::kTimeout     ? Reply::kTimeout
@@ -37,8 +39,6 @@ RouterReply ReplyOf(const StepResult& result) {
                                                                  : Reply::kGarbage;
     return result.blDone ? RouterReply{} : RouterReply{enReply, result.szWhy};
 }
-
-}  // namespace
 
 Abilities PagesRouter::What() const {
     return {.blShows = mOperations.Has(kStepList),

@@ -14,6 +14,9 @@
 
 namespace tavo {
 
+// What a step came to, as an answer.
+RouterReply ReplyOf(const StepResult& result);
+
 class PagesRouter : public Router {
 public:
     PagesRouter(Session& session, const Operations& operations) : mSession(session), mOperations(operations) {}

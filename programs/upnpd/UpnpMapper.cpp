@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <chrono>
-#include <set>
 #include <utility>
 
 #include "programs/common/IgdRouter.h"
@@ -56,22 +55,6 @@ void UpnpMapper::Remember() const {
     KeepRouter(Gateway(), {mSzLocation, mHabit.blPermanentOnly});
 }
 
-// A router that maps no ports any more may still forward those that we made.
-void UpnpMapper::NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result) {
-    std::set<MappingKey> setWanted;
-    for (const RouterMapping& wanted : rgWanted) {
-        setWanted.insert(KeyOf(wanted));
-    }
-    for (const auto& [key, made] : mMade.Get().Here()) {
-        if (!setWanted.contains(key) && !made.IsSurelyOver(BootSeconds())) {
-            Outcome outcome = OutcomeOf({key.first, key.second, made.nBoxPort, made.szClient, made.szText, 0, true},
-                                        {PortState::kUnknown, kNoIgd});
-            outcome.blLeftOver = true;
-            result.rgOutcomes.push_back(std::move(outcome));
-        }
-    }
-}
-
 // Before the table is read: what changes after that is told.
 void UpnpMapper::KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     if (rgWanted.empty()) {
@@ -99,7 +82,10 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         mMade.Get().TurnTo(Front([] { return true; }));  // nobody is there to be asked
         PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
         result.blStopped = fnStop();
-        NameLeftOver(rgWanted, result);
+        // A router that maps no ports any more may still forward those that we made.
+        for (Outcome& left : LeftOnRecord(mMade.Get(), rgWanted, {}, result.transport, BootSeconds())) {
+            result.rgOutcomes.push_back(std::move(left));
+        }
         return result;
     }
     mMade.Get().TurnTo(Front(fnStop));

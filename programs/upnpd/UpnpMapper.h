@@ -31,7 +31,6 @@ private:
 
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
-    void NameLeftOver(const std::vector<RouterMapping>& rgWanted, PassResult& result);
     void KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 

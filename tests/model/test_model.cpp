@@ -282,15 +282,8 @@ private:
         }
         const bool blHeard = mRouter.Ask(nLife).IsOk();
         const auto it = mMapLives.find(Name().szHardware);
-        if (blHeard && it != mMapLives.end() && it->second != nLife) {
-            mPRecord->Lose(mRouter.szBox);
-        } else if (mBlDoubtful) {
-            mPRecord->Doubt();
-        }
-        if (mBlDoubtful || mNNow - mNAskedElsewhere > mHabit.nLease / 2) {
-            mHabit.mapElsewhere.clear();
-            mNAskedElsewhere = mNNow;
-        }
+        const bool blRestarted = blHeard && it != mMapLives.end() && it->second != nLife;
+        tavo::Forget(*mPRecord, mHabit, mRouter.szBox, blRestarted, mBlDoubtful, mNNow - mNBootAt);
         if (blHeard) {
             mMapLives[Name().szHardware] = nLife;
         }
@@ -435,7 +428,6 @@ private:
     int mNOtherLife = 1 << 20;             // of the other router
     std::map<std::string, int> mMapLives;  // of each router, as it was last heard
     bool mBlDoubtful = true;               // what a blind one granted may be gone
-    int64_t mNAskedElsewhere = 0;
     bool mBlOther = false;
     std::vector<RouterMapping> mRgWanted;
     bool mBlHardware = true;  // the routers can be told apart

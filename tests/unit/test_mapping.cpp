@@ -624,6 +624,27 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
 }
 
+TEST(Mapping, WhatARouterThatCannotBeAskedMayStillHaveIsNamed) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", ""});
+    record.Here() = {{{"TCP", 1}, {kBox, 1, "tavo:a"}},
+                     {{"TCP", 2}, {kBox, 2, "tavo:wanted"}},
+                     {{"TCP", 3}, {kBox, 3, "tavo:over", true, 100, 1000}},
+                     {{"TCP", 4}, {kBox, 4, "tavo:moved"}}};
+    for (const bool blForm : {false, true}) {
+        std::vector<std::string> rgszNames;
+        for (const tavo::Outcome& left :
+             tavo::LeftOnRecord(record, {Entry(2, 2, "", "tavo:wanted"), Entry(4, 5, "", "tavo:moved")},
+                                {.blForm = blForm}, {tavo::Reply::kUnreachable, "noigd"}, 2000)) {
+            EXPECT_TRUE(left.blLeftOver && left.verdict.enState == tavo::PortState::kUnknown);
+            rgszNames.push_back(left.szName + " " + left.verdict.szWord);
+        }
+        const std::vector<std::string> rgExpected = {"1/tcp noigd", "4/tcp noigd"};
+        EXPECT_EQ(rgszNames, (std::vector<std::string>{rgExpected.begin(), rgExpected.end() - (blForm ? 0 : 1)}))
+            << "a form has an entry beside the one that is to take its place";
+    }
+}
+
 TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
     tavo::Record record("", "one");
     record.TurnTo({"192.168.1.1", "aa:bb"});
