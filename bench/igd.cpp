@@ -11,7 +11,7 @@
 #include "ground/TextFile.h"
 #include "mapping/Carry.h"
 #include "programs/common/IgdRouter.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 #include "tavo/net.h"
 #include "wire/upnp/Igd.h"
 

@@ -202,9 +202,8 @@ int RuleMapper::SecondsToNext(const PassResult& result, bool blRequested) {
 
 // What the rules themselves say of the outcomes: whose they are, and what was not asked of the router at all.
 void RuleMapper::AddRules(OutcomeList& rgOutcomes) const {
-    for (Outcome& outcome : rgOutcomes) {
-        const auto it = mWanted.mapRules.find(outcome.szName);
-        outcome.szRule = it == mWanted.mapRules.end() || outcome.blLeftOver ? "" : it->second;
+    for (size_t i = 0; i < std::min(rgOutcomes.size(), mWanted.rgszRules.size()); ++i) {
+        rgOutcomes[i].szRule = mWanted.rgszRules[i];
     }
     rgOutcomes.insert(rgOutcomes.end(), mWanted.rgRefused.begin(), mWanted.rgRefused.end());
 }

@@ -19,9 +19,9 @@
 #include "programs/common/MadeFile.h"
 #include "programs/common/Published.h"
 #include "programs/common/RouterTurn.h"
+#include "programs/common/RuleFile.h"
 #include "programs/common/Teller.h"
 #include "programs/common/ToldFile.h"
-#include "programs/common/Wanted.h"
 #include "wire/upnp/Notify.h"
 
 namespace tavo {

@@ -9,7 +9,7 @@
 #include "ground/ConfList.h"
 #include "ground/PortText.h"
 #include "mapping/Record.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 
 namespace tavo {
 
@@ -44,7 +44,7 @@ public:
     explicit Splitter(const TAVO_PF_CONF* pDescription)
         : mPort(ReadPage(pDescription, "PF port page")), mRange(ReadPage(pDescription, "PF range page")) {}
 
-    void Add(const TAVO_PF_CONF* pRule);
+    void Add(const RuleText& rule);
     JobSet Take() { return std::move(mJobs); }
 
 private:
@@ -53,28 +53,28 @@ private:
     void Refuse(const Job& job, const char* szWhy) {
         mJobs.rgRefusals.push_back({MappingName(job.mapping), szWhy, job});
     }
-    void RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy);
+    void RefuseRule(const RuleText& rule, const char* szWhy);
 
     Page mPort;
     Page mRange;
     JobSet mJobs;
 };
 
-void Splitter::RefuseRule(const TAVO_PF_CONF* pRule, const char* szWhy) {
-    mJobs.rgRefusals.push_back({RuleName(pRule), szWhy, {{}, RuleTitle(pRule)}});
+void Splitter::RefuseRule(const RuleText& rule, const char* szWhy) {
+    mJobs.rgRefusals.push_back({RuleName(rule), szWhy, {{}, RuleTitle(rule)}});
 }
 
-void Splitter::Add(const TAVO_PF_CONF* pRule) {
-    if (MayBeCut(Value(pRule, "r_port")) || MayBeCut(Value(pRule, "s_port"))) {
-        RefuseRule(pRule, "its list of ports is so long that it may have lost its end; write it as two rules");
+void Splitter::Add(const RuleText& rule) {
+    if (MayBeCut(rule.szRouterPorts) || MayBeCut(rule.szBoxPorts)) {
+        RefuseRule(rule, "its list of ports is so long that it may have lost its end; write it as two rules");
         return;
     }
-    const auto protocols = ParseProtocol(Value(pRule, "protocol name"));
-    const auto rgRanges = ParsePortRanges(Value(pRule, "r_port"));
+    const auto protocols = ParseProtocol(rule.szProtocol);
+    const auto rgRanges = ParsePortRanges(rule.szRouterPorts);
     // One protocol is enough to pair the ports.
-    const auto rgPairs = ExpandRule("tcp", Value(pRule, "r_port"), Value(pRule, "s_port"));
+    const auto rgPairs = ExpandRule("tcp", rule.szRouterPorts, rule.szBoxPorts);
     if (!protocols || !rgRanges || !rgPairs) {
-        RefuseRule(pRule, "its ports cannot be paired");
+        RefuseRule(rule, "its ports cannot be paired");
         return;
     }
     size_t nPair = 0;
@@ -83,10 +83,10 @@ void Splitter::Add(const TAVO_PF_CONF* pRule) {
         const uint16_t nBoxFirst = (*rgPairs)[nPair].nBoxPort;
         nPair += size_t{nMore} + 1;
         if ((*rgPairs)[nPair - 1].nBoxPort - nBoxFirst != nMore) {
-            RefuseRule(pRule, "a range of router ports needs one range of the box's ports");
+            RefuseRule(rule, "a range of router ports needs one range of the box's ports");
             continue;
         }
-        AddJob({{"", range.nFirst, nBoxFirst, "", MappingDescription(pRule), 0, true, nMore}, RuleTitle(pRule)},
+        AddJob({{"", range.nFirst, nBoxFirst, "", MappingDescription(rule), 0, true, nMore}, RuleTitle(rule)},
                *protocols);
     }
 }
@@ -145,7 +145,7 @@ JobSet ReadJobs(const TAVO_PF_CONF* pDescription) {
         pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCFileExist("/etc/portforward/rule.conf") == 0;
     for (const TAVO_PF_CONF* pRule = pRules.get(); pRule != nullptr; pRule = pRule->pNext) {
         if (Value(pRule, "enabled") == "1") {
-            splitter.Add(pRule);
+            splitter.Add(RuleTextOf(pRule));
         }
     }
     JobSet jobs = splitter.Take();

@@ -13,7 +13,6 @@
 #include "ground/ConfList.h"
 #include "ground/Marks.h"
 #include "ground/TextFile.h"
-#include "programs/common/Wanted.h"
 
 namespace tavo {
 

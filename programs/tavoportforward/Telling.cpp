@@ -9,7 +9,7 @@
 #include "ground/PortText.h"
 #include "ground/SysLog.h"
 #include "programs/common/Published.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 #include "tavo/log.h"
 
 namespace tavo {
@@ -132,13 +132,13 @@ void TellNotTried(RunResult result, const std::string& szWhy) {
     }
     result.szRouterWhy = szWhy;
     for (const TAVO_PF_CONF* pRule = pRules.get(); pRule != nullptr; pRule = pRule->pNext) {
-        const auto rgSingles =
-            ExpandRule(Value(pRule, "protocol name"), Value(pRule, "r_port"), Value(pRule, "s_port"));
         if (Value(pRule, "enabled") != "1") {
             continue;
         }
+        const RuleText rule = RuleTextOf(pRule);
+        const auto rgSingles = ExpandRule(rule.szProtocol, rule.szRouterPorts, rule.szBoxPorts);
         for (const SingleMapping& single : rgSingles.value_or(std::vector<SingleMapping>())) {
-            const Job job{{single.szProtocol, single.nRouterPort, single.nBoxPort, "", ""}, RuleTitle(pRule)};
+            const Job job{{single.szProtocol, single.nRouterPort, single.nBoxPort, "", ""}, RuleTitle(rule)};
             result.rgRefusals.push_back({MappingName(job.mapping), szWhy, job, RefusalKind::kForward, false});
         }
     }

@@ -19,7 +19,7 @@
 
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 #include "programs/common/Watch.h"
 #include "tavo/core.h"
 #include "tavo/log.h"

@@ -16,7 +16,7 @@
 #include "ground/Marks.h"
 #include "mapping/Carry.h"
 #include "programs/common/IgdRouter.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 #include "wire/upnp/Igd.h"
 #include "wire/upnp/Search.h"
 

@@ -11,8 +11,10 @@
 #include <tuple>
 
 #include "ground/BootTimer.h"
+#include "ground/PortText.h"
 #include "mapping/Carry.h"
 #include "mapping/Keeper.h"
+#include "mapping/Wanted.h"
 #include "programs/common/IgdRouter.h"
 #include "programs/common/MadeFile.h"
 #include "programs/upnpd/TestMappings.h"
@@ -724,6 +726,68 @@ TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
         record.TurnTo({"192.168.1.1", szHardware});
         ASSERT_EQ(record.Here().size(), 1U);
         EXPECT_EQ((record.Here()[{"TCP", 1}].szText), szHardware);
+    }
+}
+
+TEST(Rules, EachOutcomeHasANameOfItsOwn) {
+    std::vector<tavo::RuleText> rgRules;
+    for (const char* szBoxPorts : {"1-2", "9", "8", "7", "1-3"}) {
+        rgRules.push_back({"web", "tcp", "9", szBoxPorts});
+    }
+    const tavo::WantedSet wanted = tavo::Expand(rgRules);
+    ASSERT_EQ(wanted.rgMappings.size(), 1U);
+    std::vector<std::string> rgszNames = {MappingName(wanted.rgMappings.front()) + " " + wanted.rgszRules.front()};
+    for (const tavo::Outcome& outcome : wanted.rgRefused) {
+        rgszNames.push_back(outcome.szName + " " + outcome.verdict.szWord);
+    }
+    EXPECT_EQ(rgszNames, (std::vector<std::string>{"9/tcp web", "9/tcp (web) invalid", "9/tcp (web, 2) duplicate",
+                                                   "9/tcp (web, 3) duplicate", "9/tcp (web, 4) invalid"}));
+}
+
+TEST(Rules, AreTakenApartPairByPair) {
+    using M = tavo::SingleMapping;
+    EXPECT_EQ(*tavo::ExpandRule("ALL", "80", "8080"), (std::vector<M>{{"TCP", 80, 8080}, {"UDP", 80, 8080}}));
+    EXPECT_EQ(*tavo::ExpandRule("tcp", "12-10, 1", "20-22,7"),
+              (std::vector<M>{{"TCP", 10, 20}, {"TCP", 11, 21}, {"TCP", 12, 22}, {"TCP", 1, 7}}));
+    const char* rgszBad[][3] = {{"tcp", "1-3", "1-2"}, {"icmp", "1", "1"}, {"tcp", "", ""},    {"tcp", "0", "1"},
+                                {"tcp", "65536", "1"}, {"tcp", "1x", "1"}, {"tcp", "1,", "1"}, {"tcp", "1-", "1"}};
+    for (const auto& rgszRule : rgszBad) {
+        EXPECT_FALSE(tavo::ExpandRule(rgszRule[0], rgszRule[1], rgszRule[2])) << rgszRule[1];
+    }
+}
+
+// 204 ports take 1,019 bytes, so that the rest is what a cut leaves of the next ones.
+std::string LongList(const std::string& szRest) {
+    std::string szPorts;
+    for (int nPort = 1001; nPort < 1408; nPort += 2) {
+        szPorts += std::to_string(nPort) + ",";
+    }
+    return szPorts.substr(0, szPorts.size() - 1) + szRest;
+}
+
+TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
+    ASSERT_EQ(LongList("").size(), 1019U);
+    const struct {
+        std::string szRouter;
+        std::string szBox;
+        size_t nPairs;
+        bool blCut;
+    } rgCases[] = {
+        {LongList(",443"), LongList(",443"), 204, true},     // of 4433, perhaps
+        {LongList(",5-9"), LongList(",5-9"), 204, true},     // of 5-9000, perhaps
+        {LongList(",44,"), LongList(",44,"), 205, true},     // between two
+        {LongList(",443"), LongList(",44,45"), 204, true},   // the sides are cut at different places
+        {LongList(",44"), LongList(",44"), 205, false},      // a byte is left
+        {LongList(",4433"), LongList(",4433"), 205, false},  // written by hand, and whole
+    };
+    for (const auto& c : rgCases) {
+        const auto rgPairs = tavo::ExpandRule("tcp", c.szRouter, c.szBox);
+        ASSERT_TRUE(rgPairs) << c.szRouter;
+        EXPECT_EQ(rgPairs->size(), c.nPairs) << c.szRouter;
+        const tavo::WantedSet wanted = tavo::Expand({{"1", "tcp", c.szRouter, c.szBox}});
+        EXPECT_EQ(wanted.rgMappings.size(), c.nPairs);
+        ASSERT_EQ(wanted.rgRefused.size(), c.blCut ? 1U : 0U);
+        EXPECT_TRUE(!c.blCut || wanted.rgRefused[0].verdict.szWord == "cut");
     }
 }
 

@@ -14,7 +14,6 @@
 #include "ground/PortText.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
-#include "programs/common/Wanted.h"
 #include "programs/tavohook/Hooks.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
@@ -353,77 +352,6 @@ TEST(RouterDatabase, ARefreshThatIsKilledOrFailsLosesNothing) {
     EXPECT_EQ(fnEntries(), 1);
     for (const char* szPlace : {"/etc.defaults/portforward", "/etc/tavo/platform.conf", "/usr/tavo/bin/wget"}) {
         std::filesystem::remove_all(szPlace);
-    }
-}
-
-TEST(Rules, EachOutcomeHasANameOfItsOwn) {
-    std::string szRules;
-    for (const char* szPorts : {"\"9\"\ns_port=\"1-2\"", "\"9\"\ns_port=\"9\"", "\"9\"\ns_port=\"8\"",
-                                "\"9\"\ns_port=\"7\"", "\"9\"\ns_port=\"1-3\""}) {
-        szRules += "[" + std::to_string(szRules.size()) +
-                   "]\nenabled=\"1\"\nservice=\"web\"\nprotocol name=\"tcp\"\nr_port=" + szPorts + "\n";
-    }
-    Write("/etc/portforward/rule.conf", szRules);
-    Write("/etc/tavoinfo.conf", "runupnpportmapping=\"yes\"\n");
-    const tavo::WantedSet wanted = tavo::ReadWanted("runupnpportmapping");
-    ASSERT_EQ(wanted.rgMappings.size(), 1U);
-    std::vector<std::string> rgszNames = {MappingName(wanted.rgMappings.front())};
-    for (const tavo::Outcome& outcome : wanted.rgRefused) {
-        rgszNames.push_back(outcome.szName + " " + outcome.verdict.szWord);
-    }
-    EXPECT_EQ(rgszNames, (std::vector<std::string>{"9/tcp", "9/tcp (web) invalid", "9/tcp (web, 2) duplicate",
-                                                   "9/tcp (web, 3) duplicate", "9/tcp (web, 4) invalid"}));
-    std::filesystem::remove("/etc/portforward/rule.conf");
-    std::filesystem::remove("/etc/tavoinfo.conf");
-}
-
-TEST(Rules, AreTakenApartPairByPair) {
-    using M = tavo::SingleMapping;
-    EXPECT_EQ(*tavo::ExpandRule("ALL", "80", "8080"), (std::vector<M>{{"TCP", 80, 8080}, {"UDP", 80, 8080}}));
-    EXPECT_EQ(*tavo::ExpandRule("tcp", "12-10, 1", "20-22,7"),
-              (std::vector<M>{{"TCP", 10, 20}, {"TCP", 11, 21}, {"TCP", 12, 22}, {"TCP", 1, 7}}));
-    const char* rgszBad[][3] = {{"tcp", "1-3", "1-2"}, {"icmp", "1", "1"}, {"tcp", "", ""},    {"tcp", "0", "1"},
-                                {"tcp", "65536", "1"}, {"tcp", "1x", "1"}, {"tcp", "1,", "1"}, {"tcp", "1-", "1"}};
-    for (const auto& rgszRule : rgszBad) {
-        EXPECT_FALSE(tavo::ExpandRule(rgszRule[0], rgszRule[1], rgszRule[2])) << rgszRule[1];
-    }
-}
-
-// 204 ports take 1,019 bytes, so that the rest is what a cut leaves of the next ones.
-std::string LongList(const std::string& szRest) {
-    std::string szPorts;
-    for (int nPort = 1001; nPort < 1408; nPort += 2) {
-        szPorts += std::to_string(nPort) + ",";
-    }
-    return szPorts.substr(0, szPorts.size() - 1) + szRest;
-}
-
-TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
-    ASSERT_EQ(LongList("").size(), 1019U);
-    const struct {
-        std::string szRouter;
-        std::string szBox;
-        size_t nPairs;
-        bool blCut;
-    } rgCases[] = {
-        {LongList(",443"), LongList(",443"), 204, true},     // of 4433, perhaps
-        {LongList(",5-9"), LongList(",5-9"), 204, true},     // of 5-9000, perhaps
-        {LongList(",44,"), LongList(",44,"), 205, true},     // between two
-        {LongList(",443"), LongList(",44,45"), 204, true},   // the sides are cut at different places
-        {LongList(",44"), LongList(",44"), 205, false},      // a byte is left
-        {LongList(",4433"), LongList(",4433"), 205, false},  // written by hand, and whole
-    };
-    for (const auto& c : rgCases) {
-        const auto rgPairs = tavo::ExpandRule("tcp", c.szRouter, c.szBox);
-        ASSERT_TRUE(rgPairs) << c.szRouter;
-        EXPECT_EQ(rgPairs->size(), c.nPairs) << c.szRouter;
-        Write("/etc/tavoinfo.conf", "runupnpportmapping=\"yes\"\n");
-        Write("/etc/portforward/rule.conf",
-              "[1]\nenabled=1\nr_port=\"" + c.szRouter + "\"\ns_port=\"" + c.szBox + "\"\nprotocol name=tcp\n");
-        const tavo::WantedSet wanted = tavo::ReadWanted("runupnpportmapping");
-        EXPECT_EQ(wanted.rgMappings.size(), c.nPairs);
-        ASSERT_EQ(wanted.rgRefused.size(), c.blCut ? 1U : 0U);
-        EXPECT_TRUE(!c.blCut || wanted.rgRefused[0].verdict.szWord == "cut");
     }
 }
 

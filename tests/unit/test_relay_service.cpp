@@ -10,7 +10,7 @@
 
 #include "HopLink.h"
 #include "network.h"
-#include "programs/common/Wanted.h"
+#include "programs/common/RuleFile.h"
 #include "stage.h"
 #include "tavo/core.h"
 #include "world.h"
