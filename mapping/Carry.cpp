@@ -180,12 +180,12 @@ bool Carrier::Do(Place& place, const Step& step) {
             LookAgain(place);
             return false;
         case Action::kLeave:
-            place.verdict = {PortState::kOpen, "1", {}, place.entry.nLease, true};
+            place.verdict = {PortState::kOpen, "1", {}, place.entry.nLease, false, step.szWhy};
             mPlaces.Wake(place.entry.nLease == 0 ? Places::kNever : mPlaces.Now() + place.entry.nLease);
             LookAgain(place);
             return false;
         case Action::kInTheWay:
-            place.verdict = InTheWay(mPlaces, place.entry);
+            place.verdict = InTheWay(mPlaces, place.entry, step.szWhy);
             return false;
         default:
             return false;

@@ -32,8 +32,6 @@ constexpr std::pair<std::string_view, const char*> kWhy[] = {
     {"unreachable", "the router cannot be reached"},
     {"garbage", "the router answers without sense"},
     {"stopped", "the router has not been asked yet"}};
-constexpr char kOthersMade[] = "another program of this box made it";
-constexpr char kOthersHave[] = "another program of this box has this port on the router";
 
 bool IsNumber(const std::string& szText) {
     return !szText.empty() && std::all_of(szText.begin(), szText.end(), [](char c) { return c >= '0' && c <= '9'; });
@@ -78,14 +76,8 @@ Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
 }
 
 std::string WhyOf(const Verdict& verdict) {
-    if (!verdict.szWhy.empty()) {
+    if (!verdict.szWhy.empty() || verdict.enState == PortState::kOpen) {
         return verdict.szWhy;
-    }
-    if (verdict.enState == PortState::kOpen) {
-        return verdict.blOthers ? kOthersMade : "";
-    }
-    if (verdict.blOthers) {
-        return kOthersHave;
     }
     for (const auto& [szWord, szWhy] : kWhy) {
         if (szWord == verdict.szWord) {

@@ -45,9 +45,8 @@ struct Verdict {
     std::string szWord = {};            // as the result file has it; "1" is success
     std::optional<Holder> holder = {};  // of a port that was refused for it
     uint32_t nLease = 0;                // seconds left; 0: permanent, or not known
-    bool blOthers = false;              // another program of this box made it, or has the port for something else
     bool blAnew = false;                // open, and was not there before this pass
-    std::string szWhy = {};             // where the word alone does not say it
+    std::string szWhy = {};             // the plan's reason, or another where the word alone does not say it
 };
 
 struct Outcome {

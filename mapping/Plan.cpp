@@ -30,11 +30,14 @@ Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow, boo
 Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNow, const Abilities& what) {
     const RouterMapping& entry = *view.pEntry;
     if (KeyOf(entry) != KeyOf(*view.pWanted)) {
-        return {Action::kInTheWay, "another entry has one of its ports"};
+        return {Action::kInTheWay, "another entry of the router has one of its ports"};
     }
     if (!IsOurs(entry, view.pMade, szBox)) {
         return Serves(entry, *view.pWanted, szBox) ? Step{Action::kLeave, "another program of this box made it"}
-                                                   : Step{Action::kInTheWay, "somebody else has the place"};
+               : entry.szClient == szBox
+                   ? Step{Action::kInTheWay, "another program of this box has this port on the router"}
+               : entry.szClient.empty() ? Step{Action::kInTheWay, "somebody else has this port on the router"}
+                                        : Step{Action::kInTheWay, "another device has this port on the router"};
     }
     if (entry.szClient != szBox) {
         return {Action::kReplace, "it leads to an address that this box had before"};

@@ -41,7 +41,7 @@ enum class Action {
 
 struct Step {
     Action enAction = Action::kNothing;
-    const char* szWhy = "";
+    const char* szWhy = "";  // for the log; of kLeave and kInTheWay, which end in what is said of a port, for users too
 };
 
 // Whether an entry is ours: by our record, or by our mark and our address.

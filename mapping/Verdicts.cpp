@@ -60,10 +60,10 @@ Verdict Open(Places& places, const Place& place) {
     return verdict;
 }
 
-Verdict InTheWay(const Places& places, const RouterMapping& entry) {
+Verdict InTheWay(const Places& places, const RouterMapping& entry, const char* szWhy) {
     Verdict verdict = RefusedBy({Reply::kConflict, places.what.szConflict});
     verdict.holder = Holder{entry.szClient, HarmlessText(entry.szDescription, kMaxDescription)};
-    verdict.blOthers = entry.szClient == places.around.szBox;
+    verdict.szWhy = szWhy;
     return verdict;
 }
 
@@ -73,7 +73,7 @@ Verdict StillHeld(Places& places, const Place& place, const RouterReply& reply) 
     if (pMade == nullptr) {
         return verdict;
     }
-    if (pMade->szClient != places.around.szBox) {
+    if (pMade->szClient != places.around.szBox && !places.what.blForm) {  // a form obeys everybody
         verdict.enState = PortState::kWaiting;
         verdict.szWhy = "the router keeps it for this box's former address " + pMade->szClient;
     }

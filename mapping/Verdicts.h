@@ -11,8 +11,9 @@ namespace tavo {
 
 // A mapping that the router showed.
 Verdict Open(Places& places, const Place& place);
-// A mapping that cannot be made because of another entry, and whose that is.
-Verdict InTheWay(const Places& places, const RouterMapping& entry);
+// A mapping that cannot be made because of another entry, and whose that is. szWhy: the plan's reason, where it has
+// one.
+Verdict InTheWay(const Places& places, const RouterMapping& entry, const char* szWhy = "");
 // Ours, and the router does not take it away: from whom it belongs to, which this box is no more, until its lease ends.
 Verdict StillHeld(Places& places, const Place& place, const RouterReply& reply);
 

@@ -1,8 +1,14 @@
 // The record of what was made at routers, in a file that only root can read. Relies on StateFile and the kernel's name
-// of this boot.
+// of this boot, and on the system log.
 #pragma once
 
+#include <functional>
+#include <string>
+#include <utility>
+
 #include "ground/BootId.h"
+#include "ground/SysLog.h"
+#include "mapping/Pass.h"
 #include "mapping/Record.h"
 #include "programs/common/StateFile.h"
 
@@ -19,5 +25,16 @@ private:
     StateFile mFile;
     Record mRecord;
 };
+
+// What the core needs to know of this box; what it does is logged. made outlives it.
+inline Surroundings Around(std::string szBox, std::function<bool()> fnStop, MadeFile& made) {
+    return {std::move(szBox), BootSeconds, std::move(fnStop), [&made] { return made.Save(); },
+            [](const RouterMapping& mapping, const Step& step) {
+                const bool blOpened = step.enAction == Action::kAdd;
+                SysLog(LOG_INFO, "%s %s %s:%u: %s", MappingName(mapping).c_str(),
+                       blOpened ? "is to lead to" : "no longer leads to", mapping.szClient.c_str(),
+                       static_cast<unsigned>(mapping.nBoxPort), step.szWhy);
+            }};
+}
 
 }  // namespace tavo

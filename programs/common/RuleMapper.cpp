@@ -115,16 +115,6 @@ bool RuleMapper::OnNetworkChange() {
     return std::exchange(mSzNetwork, szNow) != szNow;
 }
 
-Surroundings RuleMapper::Around(const std::function<bool()>& fnStop, MadeFile& made) const {
-    return {mSzBox, BootSeconds, fnStop, [&made] { return made.Save(); },
-            [](const RouterMapping& mapping, const Step& step) {
-                const bool blOpened = step.enAction == Action::kAdd;
-                SysLog(LOG_INFO, "%s %s %s:%u: %s", MappingName(mapping).c_str(),
-                       blOpened ? "is to lead to" : "no longer leads to", mapping.szClient.c_str(),
-                       static_cast<unsigned>(mapping.nBoxPort), step.szWhy);
-            }};
-}
-
 RouterName RuleMapper::Front(const std::function<bool()>& fnStop) {
     std::string szHardware = HardwareAddress(mSzGateway);
     if (szHardware.empty() && IsNeighbourThere(mSzGateway, fnStop)) {

@@ -61,8 +61,6 @@ protected:
     // or else the same as before.
     RouterName Front(const std::function<bool()>& fnStop);
     uint32_t WishedLease() const { return mNWishedLease; }
-    // What the core needs to know of this box; what it does is logged.
-    Surroundings Around(const std::function<bool()>& fnStop, MadeFile& made) const;
 
 private:
     bool MendRunKeys();

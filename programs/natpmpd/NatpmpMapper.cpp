@@ -82,7 +82,7 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
     mHabit.nLease = WishedLease();
     // The gateway cannot be asked what it has: a request has every mapping asked for again.
     Forget(record, mHabit, Box(), blRestarted, blRequested || mBlDoubtful, BootSeconds());
-    const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, Around(fnStop, mMade)); };
+    const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, Around(Box(), fnStop, mMade)); };
     PassResult result = fnPass();
     if (mPEpoch->TakeRestart()) {  // it restarted while we spoke
         record.Lose(Box());

@@ -9,12 +9,9 @@ namespace tavo {
 
 namespace {
 
-// The core's own words; all others are the router's or ours, and sentences already.
+// The core's own words, and the router's. Nobody but the next save goes on with what there was no time for.
 std::string WhyNot(const Verdict& verdict) {
-    return verdict.szWord == "lost"        ? "the router said yes but does not list it"
-           : verdict.szWord == "timeout"   ? "the time of one run was up; the next save goes on with it"
-           : verdict.szWord == kUnrecorded ? "the record of what was made cannot be written"
-                                           : verdict.szWord;
+    return verdict.szWord == "timeout" ? "the time of one run was up; the next save goes on with it" : WhyOf(verdict);
 }
 
 std::vector<RouterMapping> MappingsOf(const std::vector<Job>& rgJobs) {
@@ -54,7 +51,8 @@ void Forwarder::Bring(const std::vector<Job>& rgWanted) {
     }
     Habits habit{.nLease = 0, .blPermanentOnly = true};
     const PassResult result = BringInLine(mRouter, MappingsOf(rgWanted), mMade.Get(), habit,
-                                          {mSzBox, BootSeconds, [] { return false; }, [this] { return mMade.Save(); }});
+                                          Around(
+                                              mSzBox, [] { return false; }, mMade));
     for (size_t i = rgWanted.size(); i < result.rgOutcomes.size(); ++i) {  // what is left over
         Refuse(result.rgOutcomes[i], {}, RefusalKind::kRemoval);
     }

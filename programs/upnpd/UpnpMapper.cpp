@@ -96,7 +96,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     KeepEvents(rgWanted, fnStop);
     IgdRouter router(*mPIgd);
     bool blChanged = false;
-    Surroundings around = Around(fnStop, mMade);
+    Surroundings around = Around(Box(), fnStop, mMade);
     around.fnTell = [&blChanged, fnLog = around.fnTell](const RouterMapping& mapping, const Step& step) {
         blChanged = true;
         fnLog(mapping, step);

@@ -81,8 +81,8 @@ class Manual(unittest.TestCase):
         LAB.start_web("form")
         LAB.save("1,1,tcp,9999,5001", "2,1,tcp,5001,5001")
         self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
-        self.assertIn("9999/tcp (the router already forwards this port for something else)", events())
-        self.assertEqual(self.rows()[0], {"9999/tcp": ("refused", "the router already forwards this port for something else"),
+        self.assertIn("9999/tcp (another device has this port on the router)", events())
+        self.assertEqual(self.rows()[0], {"9999/tcp": ("refused", "another device has this port on the router"),
                                           "5001/tcp": ("open", "")})
         self.assertIn({"address": LAN2, "description": "tavo:another box"}, [row["holder"] for row in self.rows()[1]["rules"]])
         LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5001,5002")
@@ -102,7 +102,7 @@ class Manual(unittest.TestCase):
         table = (("changed", "form", 'gave no "token"', 3), ("hangs", "form", "did not answer in time", 13),
                  ("hangs_on_add", "form", "did not answer in time", 13), ("endless", "blind", "too long", 5),
                  ("redirects", "blind", "answered with status 302", 3),
-                 ("lies", "form", "said yes but does not list it", 5), ("lies", "json", "said yes but", 5))
+                 ("lies", "form", "said yes and does not keep it", 5), ("lies", "json", "said yes and", 5))
         for fault, flavour, why, seconds in table:
             with self.subTest(fault=fault, flavour=flavour):
                 self.forget()
@@ -190,7 +190,7 @@ class Manual(unittest.TestCase):
         LAB.run("router", f"curl -s -X POST -d 'host={former}' http://127.0.0.1:8080/move")
         self.saved({("tcp", port): (BOX, port) for port in (6001, 6002)}, "1,1,tcp,6001-6002,6001-6002")
         LAB.save("1,1,tcp,9997-9999,5001-5003", "2,1,udp,9997-9999,5001-5003")
-        why = "the router already forwards this port for something else"
+        why = "another entry of the router has one of its ports"
         self.assertEqual(self.rows()[0], {f"{port}/{protocol}": ("open", "") if protocol == "udp" else ("refused", why)
                                           for port in (9997, 9998, 9999) for protocol in ("tcp", "udp")})
         self.assertIn(f"9997-9999/tcp ({why})", events())

@@ -102,8 +102,8 @@ std::vector<std::string> Texts(const tavo::PassResult& result) {
         rgTexts.push_back(
             outcome.szName + " " + verdict.szWord +
             (verdict.holder ? " " + verdict.holder->szAddress + " " + verdict.holder->szDescription : "") +
-            (verdict.blOthers ? " others" : "") + (verdict.blAnew ? " anew" : "") +
-            (outcome.blLeftOver ? " left over" : ""));
+            (WhyOf(verdict).starts_with("another program of this box") ? " others" : "") +
+            (verdict.blAnew ? " anew" : "") + (outcome.blLeftOver ? " left over" : ""));
     }
     return rgTexts;
 }
