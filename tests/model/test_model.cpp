@@ -183,8 +183,7 @@ private:
         std::set<MappingKey> setKeys;
         for (unsigned i = Pick(8); i > 0; --i) {
             const MappingKey key = AnyKey();
-            // A blind router lends one port for each of the box.
-            const auto nBoxPort = static_cast<uint16_t>(100 + (mRouter.habits.blBlind ? i : Pick(3)));
+            const auto nBoxPort = static_cast<uint16_t>(100 + Pick(mRouter.habits.blBlind ? 6 : 3));
             if (setKeys.insert(key).second) {
                 mRgWanted.push_back({key.first, key.second, nBoxPort, "", OneIn(2) ? "tavo:a" : "tavo:b", 0, true});
             }
@@ -406,8 +405,16 @@ private:
             const bool blWaits =
                 mRouter.habits.blBlind && (mHabit.mapElsewhere.contains(key) ||
                                            (made != mPRecord->Here().end() && made->second.szClient != mRouter.szBox));
+            // A blind one lends one port for each of the box: to the first rule.
+            const bool blShared =
+                mRouter.habits.blBlind &&
+                std::any_of(mRgWanted.begin(), mRgWanted.begin() + static_cast<std::ptrdiff_t>(i),
+                            [&](const RouterMapping& earlier) {
+                                return earlier.szProtocol == key.first && earlier.nBoxPort == mRgWanted[i].nBoxPort;
+                            });
             const bool blForgone = mBlDiskFull && result.rgOutcomes[i].verdict.szWord == tavo::kUnrecorded;
-            if (blFree && !blWaits && !blForgone && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
+            if (blFree && !blWaits && !blShared && !blForgone &&
+                result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
                 Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
             }
         }
