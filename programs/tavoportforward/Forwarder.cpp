@@ -16,6 +16,7 @@ std::string WhyNot(const Verdict& verdict) {
 
 std::vector<RouterMapping> MappingsOf(const std::vector<Job>& rgJobs) {
     std::vector<RouterMapping> rgMappings;
+    rgMappings.reserve(rgJobs.size());
     for (const Job& job : rgJobs) {
         rgMappings.push_back(job.mapping);
     }
