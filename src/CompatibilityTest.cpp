@@ -5,9 +5,14 @@
 
 #include <algorithm>
 #include <csignal>
+#include <cstdio>
 #include <cstring>
 
-#include "common.h"
+#include "Border.h"
+#include "Lock.h"
+#include "Log.h"
+#include "Text.h"
+#include "tavo/core.h"
 #include "tavo/log.h"
 #include "tavo/upnp.h"
 #include "tavo/upnptest.h"

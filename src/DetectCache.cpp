@@ -6,7 +6,11 @@
 #include <cstring>
 #include <iterator>
 
-#include "common.h"
+#include "Border.h"
+#include "Log.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 
 const std::string SZF_DETECT_MANUAL_CACHE = "/etc/portforward/router_detect.cache";
 const std::string SZ_ROUER_INIT = "router_detect";

@@ -8,7 +8,11 @@
 #include <cerrno>
 #include <cstring>
 
-#include "common.h"
+#include "Border.h"
+#include "Lock.h"
+#include "Log.h"
+#include "Text.h"
+#include "tavo/core.h"
 #include "tavo/net.h"
 
 namespace {

@@ -2,7 +2,7 @@
 // names here is exported.
 #pragma once
 
-#include "common.h"
+#include "libtavoportmap.h"
 #include "src/merge/OperationRules.h"
 
 namespace tavo::lib {

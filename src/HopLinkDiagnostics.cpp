@@ -1,10 +1,15 @@
 // The diagnostic entry points: what a developer's tool drives the relay service's port mapping with, one
 // step at a time. Relies on the operation rules and the passes over them. Promises: results go to
 // standard output, errors to the system log; everything built is freed on every path.
+#include <cstdio>
 #include <cstring>
+#include <iterator>
 
+#include "Border.h"
 #include "HopLink.h"
+#include "Log.h"
 #include "RouterConflicts.h"
+#include "Text.h"
 
 namespace {
 

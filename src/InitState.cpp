@@ -2,8 +2,12 @@
 // the stores' readers. Promises: see InitState.h.
 #include "InitState.h"
 
-#include "common.h"
+#include <memory>
+
+#include "Log.h"
+#include "Paths.h"
 #include "src/merge/MergeHost.h"
+#include "tavo/core.h"
 
 namespace tavo::lib {
 

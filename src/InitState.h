@@ -2,7 +2,7 @@
 // cache and the compatibility database. Promises: only reads.
 #pragma once
 
-#include "common.h"
+#include "libtavoportmap.h"
 
 namespace tavo::lib {
 

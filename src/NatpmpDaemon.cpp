@@ -5,7 +5,11 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "common.h"
+#include "Border.h"
+#include "DaemonStart.h"
+#include "Log.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 #include "tavo/natpmp.h"
 
 namespace {

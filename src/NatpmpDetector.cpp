@@ -4,7 +4,12 @@
 // is bounded; a record that was begun is published on every path.
 #include <unistd.h>
 
-#include "common.h"
+#include "Border.h"
+#include "DaemonStart.h"
+#include "Lock.h"
+#include "Log.h"
+#include "Sections.h"
+#include "TaskRecord.h"
 #include "tavo/task.h"
 
 namespace {

@@ -1,6 +1,11 @@
 // Runs the tool that applies the rules on a manual router. Relies on the platform's shell command.
 // Promises: returns when the tool has returned; only a shell that cannot be started is a failure.
-#include "common.h"
+#include <cstdio>
+
+#include "Log.h"
+#include "Paths.h"
+#include "libtavoportmap.h"
+#include "tavo/core.h"
 
 namespace {
 

@@ -3,7 +3,10 @@
 #include <algorithm>
 #include <cstdlib>
 
-#include "common.h"
+#include "Border.h"
+#include "Entry.h"
+#include "Log.h"
+#include "Sections.h"
 #include "tavo/porttest.h"
 
 namespace {

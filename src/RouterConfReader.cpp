@@ -1,8 +1,14 @@
 // Reads the section of one gateway in router.conf. Relies on the platform's port-forward library for
 // the parsed list. Promises: one snapshot for the object's life; a missing key leaves the output alone.
-#include "common.h"
 
 #include <cstring>
+
+#include "Border.h"
+#include "Log.h"
+#include "Text.h"
+#include "libtavoportmap.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
 
 namespace {
 

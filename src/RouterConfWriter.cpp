@@ -1,9 +1,15 @@
 // Builds the current gateway's section and replaces router.conf with it. Relies on the gateway address
 // and the platform's port-forward library. Promises: nothing reaches the disk before Sync(), and a
 // Sync() that fails leaves the file that was there.
-#include "common.h"
 
 #include <cstring>
+
+#include "Border.h"
+#include "Log.h"
+#include "Paths.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 
 namespace {
 

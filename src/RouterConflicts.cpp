@@ -1,10 +1,13 @@
 // Asks a UPnP router what other hosts hold, and takes it away. Relies on the router's settings, on the platform's UPnP
 // client and network library, and on the merge. Promises: see RouterConflicts.h.
+
 #include "RouterConflicts.h"
 
 #include <cstring>
+#include <memory>
 
 #include "HopLink.h"
+#include "Log.h"
 #include "src/merge/UsedPorts.h"
 #include "tavo/net.h"
 #include "tavo/upnp.h"

@@ -1,12 +1,17 @@
 // The description of the manual router behind a gateway, flat and typed, and the list of known models.
 // Relies on the platform's description loader, model list and refresh. Promises: the description is
 // built at most once; a failed build is tried again by the next accessor.
-#include "common.h"
 
 #include <strings.h>
 
 #include <cstdlib>
 #include <cstring>
+
+#include "Border.h"
+#include "Log.h"
+#include "Sections.h"
+#include "Text.h"
+#include "libtavoportmap.h"
 
 namespace {
 

@@ -1,6 +1,8 @@
 // Walks the rules of rule.conf or testrule.conf. Relies on the platform's port-forward library and the
 // accessors of a parsed section. Promises: one snapshot, loaded by the first StartNextRule().
-#include "common.h"
+#include "Log.h"
+#include "libtavoportmap.h"
+#include "tavo/portforward.h"
 
 namespace {
 

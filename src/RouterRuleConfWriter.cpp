@@ -1,6 +1,11 @@
 // Builds a whole rule file from rules. Relies on the platform's port-forward library for nodes, hashes
 // and the write. Promises: a Sync() that fails leaves the rules that were there.
-#include "common.h"
+#include "Border.h"
+#include "Log.h"
+#include "Paths.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 
 namespace {
 

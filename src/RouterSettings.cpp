@@ -7,7 +7,12 @@
 #include <cstdio>
 #include <cstring>
 
-#include "common.h"
+#include "Border.h"
+#include "Entry.h"
+#include "Log.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "Text.h"
 
 namespace {
 

@@ -1,11 +1,19 @@
 // Which routers honour UPnP, how many rules they hold and which description fits them. Relies on the
 // platform's section files and the download tool. Promises: the downloaded file's word comes first,
 // the user's own record second; a lookup never changes a file, but for fetching a lost database.
-#include "common.h"
 
 #include <strings.h>
 
+#include <cstdio>
 #include <cstring>
+
+#include "Border.h"
+#include "Log.h"
+#include "Paths.h"
+#include "Text.h"
+#include "libtavoportmap.h"
+#include "tavo/core.h"
+#include "tavo/portforward.h"
 
 namespace {
 

@@ -1,8 +1,14 @@
 // Writes the outcome of the user's own compatibility test. Relies on the platform's section files.
 // Promises: after a successful Sync() the file holds this record and no other.
-#include "common.h"
 
 #include <unistd.h>
+
+#include "Border.h"
+#include "Log.h"
+#include "Paths.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 
 namespace {
 

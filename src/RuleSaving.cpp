@@ -7,7 +7,12 @@
 #include <cstdio>
 #include <cstring>
 
-#include "common.h"
+#include "Border.h"
+#include "DaemonStart.h"
+#include "Entry.h"
+#include "Log.h"
+#include "Text.h"
+#include "tavo/core.h"
 #include "tavo/log.h"
 
 namespace {

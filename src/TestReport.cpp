@@ -4,11 +4,18 @@
 // text from the router leaves /tmp or reaches a shell as anything but a name.
 #include <signal.h>
 
+#include <cstdio>
 #include <ctime>
 #include <optional>
 #include <string_view>
 
-#include "common.h"
+#include "Border.h"
+#include "Log.h"
+#include "Paths.h"
+#include "ReplaceFile.h"
+#include "Sections.h"
+#include "Text.h"
+#include "libtavoportmap.h"
 #include "tavo/upnptest.h"
 
 namespace {

@@ -3,7 +3,11 @@
 #include <strings.h>
 #include <unistd.h>
 
-#include "common.h"
+#include "Border.h"
+#include "DaemonStart.h"
+#include "Log.h"
+#include "Sections.h"
+#include "libtavoportmap.h"
 
 namespace {
 

@@ -1,7 +1,15 @@
 // Whether the gateway speaks UPnP, what it is, and whether its model is known to work. Relies on the
 // platform's UPnP client and task records and on the compatibility database. Promises: one detection at a
 // time; a record that was begun is published on every path, and describes the last run only.
-#include "common.h"
+#include <memory>
+
+#include "Border.h"
+#include "DaemonStart.h"
+#include "Lock.h"
+#include "Log.h"
+#include "TaskRecord.h"
+#include "Text.h"
+#include "tavo/core.h"
 #include "tavo/task.h"
 #include "tavo/upnp.h"
 

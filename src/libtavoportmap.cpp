@@ -4,13 +4,20 @@
 // Promises: arguments are checked before any work, locks are given back on every path.
 #include <sys/stat.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 
-#include "common.h"
+#include "Border.h"
+#include "Entry.h"
+#include "Log.h"
+#include "Sections.h"
+#include "tavo/net.h"
 
 namespace {
 
+constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kTestScript[] = "testupnp.sh";
 
 using tavo::lib::AtBorder;
@@ -27,6 +34,42 @@ int gFdRouterLock = -1;
 constexpr const char* kSupportWords[] = {"no", "yes", "unknown"};
 
 }  // namespace
+
+namespace tavo::lib {
+
+bool IsGatewayAddress(const char* szGwRouterIP) {
+    if (szGwRouterIP == nullptr) {
+        LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
+        return false;
+    }
+    if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
+        LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
+        return false;
+    }
+    return true;
+}
+
+bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
+    if (lock.Get()) {
+        return true;
+    }
+    LogError("%s:%d PortForward conflict = %s", kEntryFile, __LINE__, kRouterLock);
+    if (pErr != nullptr) {
+        *pErr = TAVO_LIBTAVOPORTMAP_ERR_CONFLICT;
+    }
+    return false;
+}
+
+bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule) {
+    if (rules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
+                      rule.szServiceID, rule.szServiceName) == 0) {
+        LogError("%s:%d add rule failed", kEntryFile, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+}  // namespace tavo::lib
 
 int TLibSupportEnumToString(char* szOut, int nOutSize, __tag_TAVO_ROUTER_SUPPORT enSupport) {
     if (szOut == nullptr) {
@@ -145,7 +188,7 @@ bool IsRuleFileThere(const char* szPath, bool blRuleConf) {
 
 int GetRulesArrFromConfFile(int* pnRules, __tag_TAVO_ROUTER_RULE** ppRules, bool blRuleConf, char* szIdList,
                             bool blLock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
-    const char* szPath = blRuleConf ? tavo::lib::kRuleConf : tavo::lib::kTestRuleConf;
+    const char* szPath = blRuleConf ? tavo::lib::kRuleConf : kTestRuleConf;
     if (ppRules == nullptr) {
         LogError("%s:%d ppRgRules is NULL", kEntryFile, __LINE__);
         return -1;

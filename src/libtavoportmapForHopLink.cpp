@@ -4,10 +4,17 @@
 // and nothing is thrown.
 #include <unistd.h>
 
+#include <memory>
+
+#include "Border.h"
 #include "HopLink.h"
 #include "InitState.h"
+#include "Lock.h"
+#include "Log.h"
 #include "RouterConflicts.h"
+#include "Text.h"
 #include "src/merge/RuleConflicts.h"
+#include "tavo/portforward.h"
 
 namespace {
 

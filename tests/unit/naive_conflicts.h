@@ -7,6 +7,7 @@
 #include <string>
 
 #include "HopLink.h"
+#include "Log.h"
 #include "src/merge/RuleConflicts.h"
 
 namespace naive {

@@ -7,6 +7,7 @@
 #include <random>
 #include <set>
 
+#include "Text.h"
 #include "naive_conflicts.h"
 #include "world.h"
 

@@ -5,6 +5,7 @@
 #include "HopLink.h"
 #include "InitState.h"
 #include "RouterConflicts.h"
+#include "Text.h"
 #include "network.h"
 #include "world.h"
 

@@ -9,6 +9,7 @@
 #include <set>
 
 #include "HopLink.h"
+#include "Text.h"
 #include "network.h"
 #include "programs/common/RuleFile.h"
 #include "stage.h"
