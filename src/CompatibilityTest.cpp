@@ -28,6 +28,7 @@ using tavo::lib::kRouterLog;
 using tavo::lib::kTestProgress;
 using tavo::lib::kUpnpStatus;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::RouterLock;
 
 using TestResult = __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
@@ -99,11 +100,8 @@ void RemoveFile(const char* szPath) {
 }
 
 bool ReadStep(const char* szStep, char (&szValue)[kStepValueSize]) {
-    if (TLIBCFileGetKeyValue(kTestProgress, szStep, szValue, sizeof(szValue), 0) < 1) {
-        LogError("%s:%d TLIBCFileGetKeyValue() failed", kEntryFile, __LINE__);
-        return false;
-    }
-    return true;
+    return TLIBCFileGetKeyValue(kTestProgress, szStep, szValue, sizeof(szValue), 0) >= 1 ||
+           Refuse("%s:%d TLIBCFileGetKeyValue() failed", kEntryFile, __LINE__);
 }
 
 // Waits for as long as the tool works on a step. 0: done; 1: the step failed; -1: nobody can tell.
@@ -143,11 +141,8 @@ int WaitTestStep(const char* szStep) {
 }
 
 bool IsStepDone(const char* szStep) {
-    if (WaitTestStep(szStep) != 0) {
-        LogError("%s:%d TavoUpnpTestWaitMessage(%s) failed", kEntryFile, __LINE__, szStep);
-        return false;
-    }
-    return true;
+    return WaitTestStep(szStep) == 0 ||
+           Refuse("%s:%d TavoUpnpTestWaitMessage(%s) failed", kEntryFile, __LINE__, szStep);
 }
 
 // Has the test daemon take its mappings away and end; negative when that could not be asked for.
@@ -293,9 +288,8 @@ bool CompatibilityTest::CountRules() {
     Report(kStepMax, szCount);
     char szValue[kStepValueSize] = {};
     if (TLIBCFileGetKeyValue(kTestProgress, kStepMax, szValue, sizeof(szValue), 0) < 1) {
-        LogError("%s:%d %s[0x%04X %s:%d]", kEntryFile, __LINE__, "max empty", static_cast<unsigned>(TLIBCErrGet()),
-                 TLIBCErrorGetFile(), TLIBCErrorGetLine());
-        return false;
+        return Refuse("%s:%d %s[0x%04X %s:%d]", kEntryFile, __LINE__, "max empty", static_cast<unsigned>(TLIBCErrGet()),
+                      TLIBCErrorGetFile(), TLIBCErrorGetLine());
     }
     mNCounted = tavo::lib::ToInt(szValue);
     return true;

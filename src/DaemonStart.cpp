@@ -23,8 +23,7 @@ bool ExecDaemon(const DaemonControl& control) {
     char szCommand[kCommandSize] = {};
     const int nLength = std::snprintf(szCommand, sizeof(szCommand), "%s%s", kSbinDir, control.szName);
     if (nLength < 0 || TLIBCExec(szCommand, nullptr, nullptr, nullptr, nullptr) == -1) {
-        LogError("%s:%d exec %s daemon failed", control.szFile, __LINE__, control.szName);
-        return false;
+        return Refuse("%s:%d exec %s daemon failed", control.szFile, __LINE__, control.szName);
     }
     return true;
 }
@@ -37,8 +36,7 @@ bool HupDaemon(const DaemonControl& control, pid_t pid) {
 #pragma GCC diagnostic ignored "-Wformat"  // "%m" is the C library's own
     LogError("%s:%d send SIGHUP to %s failed errno=%m", control.szFile, __LINE__, control.szName);
 #pragma GCC diagnostic pop
-    LogError("%s:%d HupDaemon() %s failed", control.szFile, __LINE__, control.szName);
-    return false;
+    return Refuse("%s:%d HupDaemon() %s failed", control.szFile, __LINE__, control.szName);
 }
 
 // A daemon whose pid is not known: signalled by name, and started anew.
@@ -48,16 +46,14 @@ bool RestartDaemon(const DaemonControl& control) {
         return true;
     }
     LogError("%s:%d StartDaemon() failed", control.szFile, __LINE__);
-    LogError("%s:%d RestartDaemon() %s failed", control.szFile, __LINE__, control.szName);
-    return false;
+    return Refuse("%s:%d RestartDaemon() %s failed", control.szFile, __LINE__, control.szName);
 }
 
 bool StartFresh(const DaemonControl& control) {
     if (ExecDaemon(control)) {
         return true;
     }
-    LogError("%s:%d StartDaemon() %s failed", control.szFile, __LINE__, control.szName);
-    return false;
+    return Refuse("%s:%d StartDaemon() %s failed", control.szFile, __LINE__, control.szName);
 }
 
 }  // namespace

@@ -27,6 +27,7 @@ constexpr const char* kStateWords[] = {"unknown", "not_initialized", "upnp_natpm
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 enum ReaderState : int { kNotInitialized = 0, kFailed = 1, kSectionFound = 2, kSectionAbsent = 3 };
 
@@ -86,11 +87,7 @@ int Store(tag_TLIBC_SZHASH* pHash, const char* szKey, const char* szValue, int n
 
 // The first step of every setter but SetType().
 bool IsReady(DetectCacheWriter& writer, int nLine) {
-    if (writer.Init() == 0) {
-        LogError("%s:%d Init() failed", kFile, nLine);
-        return false;
-    }
-    return true;
+    return writer.Init() != 0 || Refuse("%s:%d Init() failed", kFile, nLine);
 }
 
 }  // namespace

@@ -22,6 +22,7 @@ using tavo::lib::FillText;
 using tavo::lib::kEntryFile;
 using tavo::lib::kRouterLock;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::RouterLock;
 
 using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
@@ -73,8 +74,7 @@ bool Detection::CheckInterface() {
     Progress(20);
     char szInterface[TAVO_TEXT_SIZE] = {};
     if (checkGwIfEnable(szInterface, sizeof(szInterface)) != 0) {
-        LogError("%s:%d Network interface is not enabled", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d Network interface is not enabled", kEntryFile, __LINE__);
     }
     FillText(mResult.szInterface, szInterface);
     return true;
@@ -130,8 +130,7 @@ bool Detection::CheckNames() {
 bool Detection::RunDetectors(RouterLock& lock) {
     const pid_t pid = TLIBCProcFork();
     if (pid < 0) {
-        LogError("%s:%d upnp fork error, errno=%s", kEntryFile, __LINE__, std::strerror(errno));
-        return false;
+        return Refuse("%s:%d upnp fork error, errno=%s", kEntryFile, __LINE__, std::strerror(errno));
     }
     if (pid == 0) {
         std::string szGatewayIP;
@@ -158,8 +157,7 @@ bool Detection::Run(bool blLock, RouterLock& lock) {
         return false;
     }
     if (CleanDetectManualCache() == 0) {
-        LogError("%s:%d Clean cached file failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d Clean cached file failed", kEntryFile, __LINE__);
     }
     if (!CheckInterface()) {
         return false;
@@ -181,11 +179,8 @@ bool Detection::Run(bool blLock, RouterLock& lock) {
     if (!RunDetectors(lock)) {
         return false;
     }
-    if (DETECT_INFO::fillRouterDetectResult(&mResult) < 0) {
-        LogError("%s:%d fillRouterDetectResult failed", kEntryFile, __LINE__);
-        return false;
-    }
-    return true;
+    return DETECT_INFO::fillRouterDetectResult(&mResult) >= 0 ||
+           Refuse("%s:%d fillRouterDetectResult failed", kEntryFile, __LINE__);
 }
 
 // Who the router is, in the words of the protocol that could tell.

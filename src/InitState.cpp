@@ -17,11 +17,8 @@ using State = __TAG_TAVO_ROUTER_INIT_STATE;
 using Conf = __tag_TAVO_ROUTER_CONF;
 
 bool ToSupport(__tag_TAVO_ROUTER_SUPPORT& enSupport, const char* szSupport) {
-    if (TLibSupportStringToEnum(&enSupport, szSupport) != 0) {
-        LogError("%s:%d TLibSupportStringToEnum(%s) failed", kHopLinkFile, __LINE__, szSupport);
-        return false;
-    }
-    return true;
+    return TLibSupportStringToEnum(&enSupport, szSupport) == 0 ||
+           Refuse("%s:%d TLibSupportStringToEnum(%s) failed", kHopLinkFile, __LINE__, szSupport);
 }
 
 // A section whose state is missing or makes no sense counts as absent: only a new detection can replace it.
@@ -45,8 +42,7 @@ bool FromCompatibilityTest(State& enState, const Conf& conf) {
     RouterUpnpDB db(conf.szBrand, conf.szModel, conf.szVersion);
     std::string szSupport;
     if (!db.GetSupport(szSupport)) {
-        LogError("%s:%d db.GetSupport() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d db.GetSupport() failed", kHopLinkFile, __LINE__);
     }
     auto enSupport = TAVO_ROUTER_SUPPORT_UNKNOWN;
     if (!ToSupport(enSupport, szSupport.c_str())) {

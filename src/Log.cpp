@@ -16,6 +16,14 @@ void LogError(const char* szFormat, ...) {
     va_end(arguments);
 }
 
+bool Refuse(const char* szFormat, ...) {
+    va_list arguments;
+    va_start(arguments, szFormat);
+    LogErrorV(szFormat, arguments);
+    va_end(arguments);
+    return false;
+}
+
 void LogErrorV(const char* szFormat, va_list arguments) {
     const int nErrno = errno;
     char* szLine = nullptr;

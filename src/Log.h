@@ -15,4 +15,7 @@ inline constexpr char kCommonFile[] = "src/common.cpp";         // what the othe
 void LogError(const char* szFormat, ...) __attribute__((format(printf, 1, 2)));
 void LogErrorV(const char* szFormat, va_list arguments);
 
+// The same, and the answer of whoever refuses: false.
+[[nodiscard]] bool Refuse(const char* szFormat, ...) __attribute__((format(printf, 1, 2)));
+
 }  // namespace tavo::lib

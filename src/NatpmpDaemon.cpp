@@ -21,6 +21,7 @@ constexpr unsigned kCallRetrySeconds = 1;
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 constexpr tavo::lib::DaemonControl kControl{kFile, tavo::lib::kNatpmpd, tavo::lib::kUpnpd, "/var/run/natpmpd.pid"};
 
@@ -49,8 +50,7 @@ bool NatpmpDaemon::CheckDaemon(bool& blRemap, std::string& strRemap) {
         int nSize = kRemapSize;
         Buffer szRemap(static_cast<char*>(std::malloc(kRemapSize)));
         if (!szRemap) {
-            LogError("%s:%d malloc fail: szRemap", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d malloc fail: szRemap", kFile, __LINE__);
         }
         std::memset(szRemap.get(), 0, kRemapSize);
         for (int nCall = 1; AskRemap(szRemap, nSize) < 0; ++nCall) {

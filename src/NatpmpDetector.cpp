@@ -31,6 +31,7 @@ constexpr char kVersion[] = "natpmp_version";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::TaskUpdate;
 
 // The list must be seen in two polls in a row, so that it is whole, unless it comes with the last one.
@@ -58,16 +59,14 @@ bool IsNoBaseStation(TaskUpdate& record) {
 bool Detect(TaskUpdate& record, tavo::lib::Hash& pHash, const char* szGatewayIP) {
     unlink(kAnnounced);
     if (TLIBServiceRestart(kService) < 0) {
-        LogError("%s:%d call TLIBNetService() error", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d call TLIBNetService() error", kFile, __LINE__);
     }
     if (!WaitForAnnouncements()) {
         return IsNoBaseStation(record);
     }
     pHash.reset(TLIBCSzHashAlloc(tavo::lib::kHashSize));
     if (!pHash) {
-        LogError("%s:%d Failed to alloc hash", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d Failed to alloc hash", kFile, __LINE__);
     }
     if (TLIBCFileGetSection(kAnnounced, szGatewayIP, pHash.get()) < 1) {
         LogError("%s:%d Failed to Get Section [%s], so that target router is not natpmp", kFile, __LINE__, szGatewayIP);
@@ -98,13 +97,11 @@ NatpmpDetector::~NatpmpDetector() = default;
 bool NatpmpDetector::Start(const char* szGatewayIP) {
     return AtBorder(false, [&] {
         if (szGatewayIP == nullptr || *szGatewayIP == '\0') {
-            LogError("%s:%d szGatewayIP is NULL or empty", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d szGatewayIP is NULL or empty", kFile, __LINE__);
         }
         tavo::lib::FileLock lock(kLock);
         if (!lock.Get()) {
-            LogError("%s:%d another natpmp detector is running", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d another natpmp detector is running", kFile, __LINE__);
         }
         tavo::lib::Hash pHash;
         NOS::TaskMgr manager(tavo::lib::kTaskOwner);
@@ -113,8 +110,7 @@ bool NatpmpDetector::Start(const char* szGatewayIP) {
             pTask.reset(manager.createTask(kTask));
         }
         if (!pTask) {
-            LogError("%s:%d memory is not enough", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d memory is not enough", kFile, __LINE__);
         }
         TaskUpdate record(*pTask);
         const bool blDetected = Detect(record, pHash, szGatewayIP);

@@ -18,8 +18,7 @@ bool PortForwardScript::Run() {
     const int nLength = std::snprintf(szCommand, sizeof(szCommand), "%s%s >/dev/null 2>&1", tavo::lib::kBinDir,
                                       tavo::lib::kForwardTool);
     if (nLength < 0 || TLIBCSystem(szCommand) == -1) {
-        tavo::lib::LogError("%s:%d execute %s failed", kFile, __LINE__, tavo::lib::kForwardTool);
-        return false;
+        return tavo::lib::Refuse("%s:%d execute %s failed", kFile, __LINE__, tavo::lib::kForwardTool);
     }
     return true;
 }

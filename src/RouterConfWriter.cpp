@@ -17,6 +17,7 @@ constexpr char kFile[] = "src/RouterConfWriter.cpp";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 bool Store(const TAVO_PF_CONF* pSection, const char* szKey, const std::string& szValue) {
     return TLIBCSzHashSetValue(pSection->pHash, szKey, szValue.c_str()) >= 0;
@@ -109,11 +110,7 @@ namespace {
 
 // The first step of every setter.
 bool IsReady(RouterConfWriter& writer, int nLine) {
-    if (writer.Init() == 0) {
-        LogError("%s:%d init failed", kFile, nLine);
-        return false;
-    }
-    return true;
+    return writer.Init() != 0 || Refuse("%s:%d init failed", kFile, nLine);
 }
 
 tavo::lib::Holds HoldsOf(const TAVO_PF_CONF* pHead) {

@@ -31,8 +31,7 @@ bool GetDefaultGatewayInterfaceIp(std::string& szLocal) {
     }
     char szGateway[kGatewaySize] = {};
     if (TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) == -1) {
-        LogError("%s:%d TAVONetDefaultGatewayGet() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d TAVONetDefaultGatewayGet() failed", kHopLinkFile, __LINE__);
     }
     for (int i = 0; i < nCards; ++i) {
         TAVO_NET_CARD card = {};
@@ -41,8 +40,7 @@ bool GetDefaultGatewayInterfaceIp(std::string& szLocal) {
             return true;
         }
     }
-    LogError("%s:%d can not find default gateway correspond interface ip", kHopLinkFile, __LINE__);
-    return false;
+    return Refuse("%s:%d can not find default gateway correspond interface ip", kHopLinkFile, __LINE__);
 }
 
 // One mapping of the router's table that is in force and not the box's own.
@@ -64,8 +62,7 @@ bool IsUpnpRouter(const std::string& szGateway, bool& blUpnp) {
     }
     auto enSupport = TAVO_ROUTER_SUPPORT_NO;
     if (TLibSupportStringToEnum(&enSupport, pConf->szSupportUpnp) != 0) {
-        LogError("%s:%d TLibSupportStringToEnum(%s) failed", kHopLinkFile, __LINE__, pConf->szSupportUpnp);
-        return false;
+        return Refuse("%s:%d TLibSupportStringToEnum(%s) failed", kHopLinkFile, __LINE__, pConf->szSupportUpnp);
     }
     blUpnp = enSupport == TAVO_ROUTER_SUPPORT_YES;
     return true;
@@ -74,20 +71,16 @@ bool IsUpnpRouter(const std::string& szGateway, bool& blUpnp) {
 bool CheckArguments(const OPERATION_RULE* rgOpRules, int nOpRules, const OPERATION_RULE* rgOpConfRules,
                     int nOpConfRules) {
     if (nOpRules < 0) {
-        LogError("%s:%d 0 > nOpRules=%d", kHopLinkFile, __LINE__, nOpRules);
-        return false;
+        return Refuse("%s:%d 0 > nOpRules=%d", kHopLinkFile, __LINE__, nOpRules);
     }
     if (nOpConfRules < 0) {
-        LogError("%s:%d 0 > nOpConfRules=%d", kHopLinkFile, __LINE__, nOpConfRules);
-        return false;
+        return Refuse("%s:%d 0 > nOpConfRules=%d", kHopLinkFile, __LINE__, nOpConfRules);
     }
     if (nOpRules > 0 && rgOpRules == nullptr) {
-        LogError("%s:%d rgOpRules == NULL", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d rgOpRules == NULL", kHopLinkFile, __LINE__);
     }
     if (nOpConfRules > 0 && rgOpConfRules == nullptr) {
-        LogError("%s:%d rgOpConfRules == NULL", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d rgOpConfRules == NULL", kHopLinkFile, __LINE__);
     }
     return true;
 }

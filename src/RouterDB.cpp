@@ -22,6 +22,7 @@ constexpr char kRangePage[] = "PF range page";
 using tavo::lib::AtBorder;
 using tavo::lib::ConfList;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 struct ScriptDeleter {
     void operator()(TAVO_ROUTER_SCRIPT* pOps) const { TAVORouterScriptFree(pOps); }
@@ -120,8 +121,7 @@ bool TakeInt(const Json::Value* pJsValue, const char* szWrongType, int nLine, in
         return false;
     }
     if (!pJsValue->isInt()) {
-        LogError(szWrongType, kFile, nLine);
-        return false;
+        return Refuse(szWrongType, kFile, nLine);
     }
     nValue = pJsValue->asInt();
     return true;
@@ -132,8 +132,7 @@ bool TakeBool(const Json::Value* pJsValue, const char* szWrongType, int nLine, b
         return false;
     }
     if (!pJsValue->isBool()) {
-        LogError(szWrongType, kFile, nLine);
-        return false;
+        return Refuse(szWrongType, kFile, nLine);
     }
     blValue = pJsValue->asBool();
     return true;
@@ -156,8 +155,7 @@ bool FillModel(__tag_TAVO_ROUTERDB_LIST& model, const char* szName) {
     std::string szModel;
     std::string szVersion;
     if (!SplitRouterName(szCopy.data(), szBrand, szModel, szVersion)) {
-        LogError("%s:%d split router name failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d split router name failed", kFile, __LINE__);
     }
     FillText(model.szBrand, szBrand);
     FillText(model.szModel, szModel);
@@ -177,16 +175,14 @@ bool RouterDB::GetRouterDesc() {
     return AtBorder(false, [&] {
         const ConfList pConf(TAVOPFGwRouterConfGet());
         if (!pConf) {
-            LogError("%s:%d get router conf failed", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d get router conf failed", kFile, __LINE__);
         }
         const TAVO_PF_CONF* pSection = pConf.get();
         while (pSection != nullptr && mSzGwRouterIP != pSection->szSection) {
             pSection = pSection->pNext;
         }
         if (pSection == nullptr || pSection->pHash == nullptr) {
-            LogError("%s:%d pRouterConf shall not be NULL", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d pRouterConf shall not be NULL", kFile, __LINE__);
         }
         TAVO_PF_CONF* pDescRaw = nullptr;
         TAVO_ROUTER_SCRIPT* pOpsRaw = nullptr;
@@ -194,8 +190,7 @@ bool RouterDB::GetRouterDesc() {
         const ConfList pDesc(pDescRaw);
         const std::unique_ptr<TAVO_ROUTER_SCRIPT, ScriptDeleter> pOps(pOpsRaw);
         if (nLoaded < 0) {
-            LogError("%s:%d get desc and script failed", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d get desc and script failed", kFile, __LINE__);
         }
         mJsDesc = Flatten(pDesc.get()).ToJson();
         mBlLoaded = 1;
@@ -241,8 +236,7 @@ bool RouterDB::IsSupportPageRange(bool& blSupport) {
 bool RouterDB::List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList) {
     return AtBorder(false, [&] {
         if (pplRouterDBList == nullptr) {
-            LogError("%s:%d pplRouterDBList is NULL", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d pplRouterDBList is NULL", kFile, __LINE__);
         }
         TLIBCSzList* pNamesRaw = nullptr;
         const int nNames = RouterDBList(&pNamesRaw);
@@ -256,8 +250,7 @@ bool RouterDB::List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList) {
             }
             auto* pNode = static_cast<__tag_TAVO_ROUTERDB_LIST*>(std::calloc(1, sizeof(__tag_TAVO_ROUTERDB_LIST)));
             if (pNode == nullptr) {
-                LogError("%s:%d malloc failed", kFile, __LINE__);
-                return false;
+                return Refuse("%s:%d malloc failed", kFile, __LINE__);
             }
             if (pTail == nullptr) {
                 pHead.reset(pNode);
@@ -276,8 +269,7 @@ bool RouterDB::List(__tag_TAVO_ROUTERDB_LIST** pplRouterDBList) {
 
 bool RouterDB::FreeList(__tag_TAVO_ROUTERDB_LIST* plRouterDBList) {
     if (plRouterDBList == nullptr) {
-        LogError("%s:%d plRouterDBList is NULL", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d plRouterDBList is NULL", kFile, __LINE__);
     }
     while (plRouterDBList != nullptr) {
         __tag_TAVO_ROUTERDB_LIST* pNext = plRouterDBList->pNext;

@@ -15,6 +15,7 @@ constexpr char kRangeJob[] = "PF add range";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 // The keys of a rule in their fixed order, each with the line of its failure; the last three lines
 // carry the value.
@@ -24,30 +25,22 @@ bool FillRule(TLIBCSzHash* pHash, bool blEnable, const std::string& szRouterPort
         return TLIBCSzHashSetValue(pHash, szKey, szValue.c_str()) >= 0;
     };
     if (!fnStore("enabled", blEnable ? "1" : "0")) {
-        LogError("%s:%d set enable failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d set enable failed", kFile, __LINE__);
     }
     if (!fnStore("s_port", szSrcPort)) {
-        LogError("%s:%d set src port failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d set src port failed", kFile, __LINE__);
     }
     if (!fnStore("r_port", szRouterPort)) {
-        LogError("%s:%d set router port failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d set router port failed", kFile, __LINE__);
     }
     if (!fnStore("protocol name", szProtocol)) {
-        LogError("%s:%d set protocol=%s", kFile, __LINE__, szProtocol.c_str());
-        return false;
+        return Refuse("%s:%d set protocol=%s", kFile, __LINE__, szProtocol.c_str());
     }
     if (!fnStore("service_id", szServiceID)) {
-        LogError("%s:%d set serviceid=%s", kFile, __LINE__, szServiceID.c_str());
-        return false;
+        return Refuse("%s:%d set serviceid=%s", kFile, __LINE__, szServiceID.c_str());
     }
-    if (!fnStore("service", szServiceName)) {
-        LogError("%s:%d set service name=%s", kFile, __LINE__, szServiceName.c_str());
-        return false;
-    }
-    return true;
+    return fnStore("service", szServiceName) ||
+           Refuse("%s:%d set service name=%s", kFile, __LINE__, szServiceName.c_str());
 }
 
 }  // namespace

@@ -24,6 +24,7 @@ using tavo::lib::GetRouterLock;
 using tavo::lib::kEntryFile;
 using tavo::lib::kRouterConf;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::RouterLock;
 
 using RouterConf = __tag_TAVO_ROUTER_CONF;
@@ -36,8 +37,7 @@ bool IsDaemonRouter(const RouterConf& conf) {
 
 bool IsGatewayArgument(const char* szGwRouterIP, const RouterConf* pConf) {
     if (pConf == nullptr) {
-        LogError("%s:%d routerConf is NULL", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d routerConf is NULL", kEntryFile, __LINE__);
     }
     return tavo::lib::IsGatewayAddress(szGwRouterIP);
 }
@@ -61,12 +61,10 @@ bool FillIdentity(RouterConfReader& reader, RouterConf& conf) {
     for (const auto& field : rgFields) {
         std::string szText;
         if ((reader.*field.fnGet)(szText) == 0) {
-            LogError(field.szNotRead, kEntryFile, __LINE__);
-            return false;
+            return Refuse(field.szNotRead, kEntryFile, __LINE__);
         }
         if (!FillText(*field.pSzField, szText)) {
-            LogError(field.szNotCopied, kEntryFile, __LINE__);
-            return false;
+            return Refuse(field.szNotCopied, kEntryFile, __LINE__);
         }
     }
     return true;
@@ -88,8 +86,7 @@ bool FillAccount(RouterConfReader& reader, RouterConf& conf) {
     for (const auto& field : rgFields) {
         std::string szText;
         if ((reader.*field.fnGet)(szText) != 0 && !FillText(*field.pSzField, szText)) {
-            LogError(field.szNotCopied, kEntryFile, __LINE__);
-            return false;
+            return Refuse(field.szNotCopied, kEntryFile, __LINE__);
         }
     }
     return true;
@@ -98,14 +95,10 @@ bool FillAccount(RouterConfReader& reader, RouterConf& conf) {
 bool FillMaxRule(RouterConf& conf) {
     int nMaxRule = 0;
     if (!RouterUpnpDB(conf.szBrand, conf.szModel, conf.szVersion).GetMaxRule(nMaxRule)) {
-        LogError("%s:%d get max rule fail", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d get max rule fail", kEntryFile, __LINE__);
     }
-    if (std::snprintf(conf.szMaxRule, sizeof(conf.szMaxRule), "%d", nMaxRule) < 0) {
-        LogError("%s:%d snprintf szMaxRule failed", kEntryFile, __LINE__);
-        return false;
-    }
-    return true;
+    return std::snprintf(conf.szMaxRule, sizeof(conf.szMaxRule), "%d", nMaxRule) >= 0 ||
+           Refuse("%s:%d snprintf szMaxRule failed", kEntryFile, __LINE__);
 }
 
 constexpr int kNothingStored = 1;
@@ -185,45 +178,34 @@ enum class Stored { kDone, kRefused, kUndo };
 
 bool SetIdentity(RouterConfWriter& writer, const RouterConf& conf) {
     if (conf.szSupportUpnp[0] == '\0') {
-        LogError("%s:%d support_upnp shall not be empty", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d support_upnp shall not be empty", kEntryFile, __LINE__);
     }
     if (conf.szSupportNatpmp[0] == '\0') {
-        LogError("%s:%d support_natpmp shall not be empty", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d support_natpmp shall not be empty", kEntryFile, __LINE__);
     }
     if (writer.SetBrandModelVersion(conf.szBrand, conf.szModel, conf.szVersion) == 0) {
-        LogError("%s:%d save config failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d save config failed", kEntryFile, __LINE__);
     }
     if (writer.SetSupportUpnp(conf.szSupportUpnp) == 0) {
-        LogError("%s:%d save support upnp failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d save support upnp failed", kEntryFile, __LINE__);
     }
-    if (writer.SetSupportNatpmp(conf.szSupportNatpmp) == 0) {
-        LogError("%s:%d save support natpmp failed", kEntryFile, __LINE__);
-        return false;
-    }
-    return true;
+    return writer.SetSupportNatpmp(conf.szSupportNatpmp) != 0 ||
+           Refuse("%s:%d save support natpmp failed", kEntryFile, __LINE__);
 }
 
 bool SetAccount(RouterConfWriter& writer, const RouterConf& conf) {
     const bool blAccount = conf.szUser[0] != '\0';
     if (writer.SetUserPass(blAccount ? conf.szUser : "", blAccount ? conf.szPass : "") == 0) {
-        LogError("%s:%d save user/pass failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d save user/pass failed", kEntryFile, __LINE__);
     }
     if (conf.szConnType[0] == '\0') {
-        LogError("%s:%d conntype shall not be empty", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d conntype shall not be empty", kEntryFile, __LINE__);
     }
     if (conf.szConnPort[0] == '\0') {
-        LogError("%s:%d connport shall not be empty", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d connport shall not be empty", kEntryFile, __LINE__);
     }
     if (writer.SetConnType(conf.szConnType) == 0 || writer.SetConnPort(conf.szConnPort) == 0) {
-        LogError("%s:%d save config failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d save config failed", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -232,8 +214,7 @@ bool RenameOrLog(const char* szFrom, const char* szTo, int nLine) {
     if (rename(szFrom, szTo) == 0) {
         return true;
     }
-    LogError("%s:%d can not save backup file of '%s'", kEntryFile, nLine, kRouterConfBak);
-    return false;
+    return Refuse("%s:%d can not save backup file of '%s'", kEntryFile, nLine, kRouterConfBak);
 }
 
 Stored StoreManual(RouterConfWriter& writer, const char* szGwRouterIP, const RouterConf& conf, bool blHeld,

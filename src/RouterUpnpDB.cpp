@@ -27,6 +27,7 @@ constexpr int kVersionSize = 8;
 using tavo::lib::AtBorder;
 using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 bool Lookup(const char* szPath, const std::string& szSection, const char* szKey, char (&szValue)[kValueSize]) {
     return TLIBCFileGetSectionValue(szPath, szSection.c_str(), szKey, szValue, kValueSize) == 0;
@@ -46,8 +47,7 @@ bool Download(const char* szName) {
         std::snprintf(szCommand, sizeof(szCommand), "/usr/tavo/bin/wget '%s/%s' -O %s/%s >/dev/null 2>&1",
                       szQuoted.c_str(), szName, kDir, szName);
     if (nLength < 0 || static_cast<size_t>(nLength) >= sizeof(szCommand) || TLIBCSystem(szCommand) != 0) {
-        LogError("%s:%d update upnp router info failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d update upnp router info failed", kFile, __LINE__);
     }
     return true;
 }
@@ -67,11 +67,7 @@ bool RouterUpnpDB::IsValid() {
             LogError("%s:%d %s recover failed", kFile, __LINE__, kDb);
         }
     }
-    if (mSzKey == "//") {
-        LogError("%s:%d query brand, model, version shall not empty", kFile, __LINE__);
-        return false;
-    }
-    return true;
+    return mSzKey != "//" || Refuse("%s:%d query brand, model, version shall not empty", kFile, __LINE__);
 }
 
 bool RouterUpnpDB::GetSupport(std::string& support) {
@@ -122,8 +118,7 @@ bool RouterUpnpDB::Update(int& nVersion) {
         const int nCurrent = IGetCurrSyntaxVersion();
         char szVersion[kVersionSize] = {};
         if (TLIBCFileGetKeyValue(kVersionFile, "version", szVersion, sizeof(szVersion), 0) < 0) {
-            LogError("%s:%d can not read router sdk version", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d can not read router sdk version", kFile, __LINE__);
         }
         const int nServer = tavo::lib::ToInt(szVersion);
         // A database of another version is left alone: this tool could not read it.

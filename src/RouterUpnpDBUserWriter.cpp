@@ -17,6 +17,7 @@ constexpr char kFile[] = "src/RouterUpnpDBUserWriter.cpp";
 using tavo::lib::AtBorder;
 using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 }  // namespace
 
@@ -37,27 +38,19 @@ bool RouterUpnpDBUserWriter::Init() {
 
 bool RouterUpnpDBUserWriter::SetSupport(const std::string& support) {
     if (!Init()) {
-        LogError("%s:%d init failed", kFile, __LINE__);
-        return false;
+        return Refuse("%s:%d init failed", kFile, __LINE__);
     }
-    if (TLIBCSzHashSetValue(mPSection->pHash, "support", support.c_str()) < 0) {
-        LogError("%s:%d save config failed", kFile, __LINE__);
-        return false;
-    }
-    return true;
+    return TLIBCSzHashSetValue(mPSection->pHash, "support", support.c_str()) >= 0 ||
+           Refuse("%s:%d save config failed", kFile, __LINE__);
 }
 
 bool RouterUpnpDBUserWriter::SetMaxRule(int nMaxRule) {
     return AtBorder(false, [&] {
         if (!Init()) {
-            LogError("%s:%d init failed", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d init failed", kFile, __LINE__);
         }
-        if (TLIBCSzHashSetValue(mPSection->pHash, "max", std::to_string(nMaxRule).c_str()) < 0) {
-            LogError("%s:%d save config failed", kFile, __LINE__);
-            return false;
-        }
-        return true;
+        return TLIBCSzHashSetValue(mPSection->pHash, "max", std::to_string(nMaxRule).c_str()) >= 0 ||
+               Refuse("%s:%d save config failed", kFile, __LINE__);
     });
 }
 
@@ -70,9 +63,8 @@ bool RouterUpnpDBUserWriter::Sync() {
     const int nAdded =
         TLIBCFileAddSection(kUpnpUserDb, szSection, mPSection == nullptr ? nullptr : mPSection->pHash, 0);
     if (nAdded != 1) {
-        LogError("%s:%d fail set section into [%s] ret=%d[0x%04X %s:%d]", kFile, __LINE__, kUpnpUserDb, nAdded,
-                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
-        return false;
+        return Refuse("%s:%d fail set section into [%s] ret=%d[0x%04X %s:%d]", kFile, __LINE__, kUpnpUserDb, nAdded,
+                      static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
     }
     old.GiveTo(kUpnpUserDb);
     return true;

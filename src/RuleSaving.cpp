@@ -28,6 +28,7 @@ using tavo::lib::kNatpmpRunKey;
 using tavo::lib::kRouterLock;
 using tavo::lib::kUpnpRunKey;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::RouterLock;
 using tavo::lib::SetRunKey;
 
@@ -109,16 +110,13 @@ bool RuleSave::IsValid() const {
         return false;
     }
     if (mPfnCallback != nullptr && mPResult == nullptr) {
-        LogError("%s:%d saveResult is NULL", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d saveResult is NULL", kEntryFile, __LINE__);
     }
     if (mNRules < 0) {
-        LogError("%s:%d fail: 0 > nRules=%d", kEntryFile, __LINE__, mNRules);
-        return false;
+        return Refuse("%s:%d fail: 0 > nRules=%d", kEntryFile, __LINE__, mNRules);
     }
     if (mNRules > 0 && mRgRules == nullptr) {
-        LogError("%s:%d rgRules is NULL", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d rgRules is NULL", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -157,8 +155,7 @@ bool RuleSave::CollectRules() {
     for (int i = 0; HasRules() && i < mNRules; ++i) {
         const __tag_TAVO_ROUTER_RULE& rule = mRgRules[i];
         if (rule.szProtocol[0] == '\0' && rule.szRouterPort[0] == '\0' && rule.szSrcPort[0] == '\0') {
-            LogError("%s:%d protocol, and port should not be empty", kEntryFile, __LINE__);
-            return false;
+            return Refuse("%s:%d protocol, and port should not be empty", kEntryFile, __LINE__);
         }
         if (!tavo::lib::AddRule(mRules, rule)) {
             return false;
@@ -169,8 +166,7 @@ bool RuleSave::CollectRules() {
 
 bool RuleSave::SwitchDaemonsOff() const {
     if (!SetRunKey(kNatpmpRunKey, "no") || !SetRunKey(kUpnpRunKey, "no")) {
-        LogError("%s:%d Failed to Set run key [%s]", kEntryFile, __LINE__, tavo::lib::kSystemConf);
-        return false;
+        return Refuse("%s:%d Failed to Set run key [%s]", kEntryFile, __LINE__, tavo::lib::kSystemConf);
     }
     return true;
 }
@@ -182,25 +178,20 @@ bool RuleSave::CheckExceedMaxRule(bool& blExceed, int& nMaxRule) {
     std::string szVersion;
     int nRules = 0;
     if (mConf.GetBrand(szBrand) == 0) {
-        LogError("%s:%d fail to get brand", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d fail to get brand", kEntryFile, __LINE__);
     }
     if (mConf.GetModel(szModel) == 0) {
-        LogError("%s:%d fail to get model", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d fail to get model", kEntryFile, __LINE__);
     }
     if (mConf.GetVersion(szVersion) == 0) {
-        LogError("%s:%d fail to get version", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d fail to get version", kEntryFile, __LINE__);
     }
     RouterUpnpDB db(szBrand, szModel, szVersion);
     if (!db.GetMaxRule(nMaxRule)) {
-        LogError("%s:%d get max rule fail", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d get max rule fail", kEntryFile, __LINE__);
     }
     if (mRules.GetRules(nRules) == 0) {
-        LogError("%s:%d get setting rules fail", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d get setting rules fail", kEntryFile, __LINE__);
     }
     blExceed = nMaxRule >= 1 && nRules >= 1 && nMaxRule < nRules;
     return true;
@@ -211,13 +202,11 @@ bool RuleSave::FitsRouter() {
     bool blExceed = false;
     int nMaxRule = 0;
     if (!CheckExceedMaxRule(blExceed, nMaxRule)) {
-        LogError("%s:%d check exceed max rule fail", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d check exceed max rule fail", kEntryFile, __LINE__);
     }
     if (blExceed) {
         Limits(kStatusTooManyRules, nMaxRule);
-        LogError("%s:%d exceed max rule", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d exceed max rule", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -225,8 +214,7 @@ bool RuleSave::FitsRouter() {
 // Writes the rule file; szFailure takes the file and the line.
 bool RuleSave::WriteRules(const char* szFailure) {
     if (mRules.Sync() == 0) {
-        LogError(szFailure, kEntryFile, __LINE__);
-        return false;
+        return Refuse(szFailure, kEntryFile, __LINE__);
     }
     Progress(80);
     return true;
@@ -250,19 +238,16 @@ bool RuleSave::SaveThrough(Daemon daemon, const DaemonWay& way) {
         return false;
     }
     if (!SetRunKey(way.szRunKey, "yes")) {
-        LogError(way.szNoRunKey, kEntryFile, __LINE__);
-        return false;
+        return Refuse(way.szNoRunKey, kEntryFile, __LINE__);
     }
     if (!daemon.Start()) {
-        LogError("%s:%d upnp daemon start failed", kEntryFile, __LINE__);  // for either daemon
-        return false;
+        return Refuse("%s:%d upnp daemon start failed", kEntryFile, __LINE__);  // for either daemon
     }
     if (!HasRules()) {
         return true;
     }
     if (!WaitUntil([&] { return daemon.IsAlive() && IsSavingRules() == 0; })) {
-        LogError(way.szTimeOut, kEntryFile, __LINE__);
-        return false;
+        return Refuse(way.szTimeOut, kEntryFile, __LINE__);
     }
     LogError(way.szAlive, kEntryFile, __LINE__);
     Progress(90);
@@ -273,14 +258,12 @@ bool RuleSave::ReadBack(NatpmpDaemon& daemon) {
     bool blRemap = false;
     std::string szRemap;
     if (!daemon.CheckDaemon(blRemap, szRemap)) {
-        LogError("%s:%d check natpmp daemon failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d check natpmp daemon failed", kEntryFile, __LINE__);
     }
     LogError("%s:%d natpmpd checking is done", kEntryFile, __LINE__);
     if (blRemap) {
         Ports(kStatusConflict, szRemap);
-        LogError("%s:%d natpmp port conflict", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d natpmp port conflict", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -291,21 +274,18 @@ bool RuleSave::ReadBack(UpnpDaemon& daemon) {
     std::string szConflict;
     std::string szError;
     if (!daemon.CheckDaemon(blConflict, blError, szConflict, szError)) {
-        LogError("%s:%d check daemon failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d check daemon failed", kEntryFile, __LINE__);
     }
     LogError("%s:%d upnpd checking is done", kEntryFile, __LINE__);
     if (blConflict) {
         Ports(kStatusConflict, szConflict);
         TAVOLogSet1(1, 2, TAVO_EVENT_PF_CONFLICT, szConflict.c_str(), "", "", "");
-        LogError("%s:%d upnp port conflict", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d upnp port conflict", kEntryFile, __LINE__);
     }
     if (blError) {
         Ports(kStatusAddFailed, szError);
         TAVOLogSet1(1, 3, TAVO_EVENT_PF_ADD_FAILED, szError.c_str(), "", "", "");
-        LogError("%s:%d upnp add port fail", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d upnp add port fail", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -344,20 +324,16 @@ bool RuleSave::FitsManualRouter() {
     int nPortJob = 0;
     int nRangeJob = 0;
     if (!db.GetMaxPorts(nMaxPort)) {
-        LogError("%s:%d can not get max ports", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d can not get max ports", kEntryFile, __LINE__);
     }
     if (!db.GetMaxRange(nMaxRange)) {
-        LogError("%s:%d can not get max range", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d can not get max range", kEntryFile, __LINE__);
     }
     if (mRules.GetPorts(nPortJob, mSzGwRouterIP) == 0) {
-        LogError("%s:%d failed to count port job of rules", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d failed to count port job of rules", kEntryFile, __LINE__);
     }
     if (mRules.GetRange(nRangeJob, mSzGwRouterIP) == 0) {
-        LogError("%s:%d failed to count range job of rules", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d failed to count range job of rules", kEntryFile, __LINE__);
     }
     if (nMaxPort >= nPortJob && nMaxRange >= nRangeJob) {
         return true;
@@ -372,12 +348,10 @@ bool RuleSave::SaveManual() {
     }
     PortForwardScript script;
     if (!script.Run()) {
-        LogError("%s:%d %s start failed", kEntryFile, __LINE__, tavo::lib::kForwardTool);
-        return false;
+        return Refuse("%s:%d %s start failed", kEntryFile, __LINE__, tavo::lib::kForwardTool);
     }
     if (!WaitUntil([] { return IsSavingRules() == 0; })) {
-        LogError("%s:%d wait manual pf process finish time out", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d wait manual pf process finish time out", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -396,12 +370,10 @@ bool RuleSave::Run(bool blLock, RouterLock& lock) {
     std::string szUpnp;
     std::string szNatpmp;
     if (mConf.GetSupportUpnp(szUpnp) == 0) {
-        LogError("%s:%d can not get support upnp", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d can not get support upnp", kEntryFile, __LINE__);
     }
     if (mConf.GetSupportNatpmp(szNatpmp) == 0) {
-        LogError("%s:%d can not get support natpmp", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d can not get support natpmp", kEntryFile, __LINE__);
     }
     if (!SwitchDaemonsOff()) {
         return false;

@@ -29,12 +29,9 @@ void TaskUpdate::Set(const char* szName, const char* szValue) {
 
 bool TaskUpdate::End() {
     mBlEnded = true;
-    if (mTask.endUpdate() == 0) {
-        LogError("%s:%d the result of the detection could not be stored[0x%04X %s:%d]", kCommonFile, __LINE__,
-                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
-        return false;
-    }
-    return true;
+    return mTask.endUpdate() != 0 ||
+           Refuse("%s:%d the result of the detection could not be stored[0x%04X %s:%d]", kCommonFile, __LINE__,
+                  static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
 }
 
 std::string TaskText(const char* szId, const char* szName) {

@@ -30,6 +30,7 @@ using tavo::lib::kTestProgress;
 using tavo::lib::kUpnpStatus;
 using tavo::lib::kUpnpUserDb;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using RouterConf = __tag_TAVO_ROUTER_CONF;
 using DetectResult = __tag_TAVO_ROUTER_DETECT_RESULT;
 
@@ -91,8 +92,7 @@ public:
         if (TLIBCFileExist(kRouterConf) != 1 || (mSettings->IsHeld() && rename(kRouterConf, mSzAside.c_str()) == 0)) {
             return true;
         }
-        LogError("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());
-        return false;
+        return Refuse("%s:%d rename(%s, %s) failed ", kEntryFile, __LINE__, kRouterConf, mSzAside.c_str());
     }
 
 private:
@@ -104,8 +104,7 @@ private:
 bool DescribeDetected(RouterConf& conf, std::string& szBrand) {
     DetectResult detected = {};
     if (TLibGetRouterDetectResult(&detected) != 0) {
-        LogError("%s:%d TLibGetRouterDetectResult() failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d TLibGetRouterDetectResult() failed", kEntryFile, __LINE__);
     }
     szBrand = detected.szBrand;
     FillText(conf.szBrand, detected.szBrand);
@@ -113,13 +112,11 @@ bool DescribeDetected(RouterConf& conf, std::string& szBrand) {
     FillText(conf.szVersion, detected.szVersion);
     if (TLibSupportEnumToString(conf.szSupportUpnp, sizeof(conf.szSupportUpnp),
                                 static_cast<__tag_TAVO_ROUTER_SUPPORT>(detected.enSupportUpnp)) != 0) {
-        LogError("%s:%d TLibSupportEnumToString(enSupportUpnp) failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d TLibSupportEnumToString(enSupportUpnp) failed", kEntryFile, __LINE__);
     }
     if (TLibSupportEnumToString(conf.szSupportNatpmp, sizeof(conf.szSupportNatpmp),
                                 static_cast<__tag_TAVO_ROUTER_SUPPORT>(detected.enSupportNatpmp)) != 0) {
-        LogError("%s:%d TLibSupportEnumToString(enSupportNatpmp) failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d TLibSupportEnumToString(enSupportNatpmp) failed", kEntryFile, __LINE__);
     }
     return true;
 }
@@ -129,15 +126,11 @@ bool PackReport(const std::string& szArchive) {
     std::snprintf(szCommand, sizeof(szCommand), "/bin/tar -zcvf '%s' %s %s %s %s %s >/dev/null 2>&1", szArchive.c_str(),
                   kRouterConf, kTestProgress, kUpnpStatus, kRouterLog, kPortTestMarker);
     if (TLIBCSystem(szCommand) != 0) {
-        LogError("%s:%d failed to tar test upnp router result![0x%04X %s:%d]", kEntryFile, __LINE__,
-                 static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
-        return false;
+        return Refuse("%s:%d failed to tar test upnp router result![0x%04X %s:%d]", kEntryFile, __LINE__,
+                      static_cast<unsigned>(TLIBCErrGet()), TLIBCErrorGetFile(), TLIBCErrorGetLine());
     }
-    if (TLIBCFileExist(szArchive.c_str()) != 1) {
-        LogError("%s:%d can't found result file [%s]", kEntryFile, __LINE__, szArchive.c_str());
-        return false;
-    }
-    return true;
+    return TLIBCFileExist(szArchive.c_str()) == 1 ||
+           Refuse("%s:%d can't found result file [%s]", kEntryFile, __LINE__, szArchive.c_str());
 }
 
 // A server's name that is too long for the command is refused: a cut command is another command.
@@ -149,8 +142,7 @@ bool SendReport(const std::string& szArchive) {
         szCommand, sizeof(szCommand), "%s --digest -u '%s:%s' -F 'uploadedfile=@%s;filename=%s' '%s' >/dev/null 2>&1",
         "/usr/tavo/bin/curl", kReportUser, kReportPassword, szArchive.c_str(), szArchive.c_str(), szQuoted.c_str());
     if (nLength < 0 || static_cast<size_t>(nLength) >= sizeof(szCommand) || TLIBCSystem(szCommand) != 0) {
-        LogError("%s:%d update upnp router info failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d update upnp router info failed", kEntryFile, __LINE__);
     }
     return true;
 }

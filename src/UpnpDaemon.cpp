@@ -20,6 +20,7 @@ constexpr unsigned kReadRetrySeconds = 1;
 using tavo::lib::AtBorder;
 using tavo::lib::Hash;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 constexpr tavo::lib::DaemonControl kControl{kFile, tavo::lib::kUpnpd, tavo::lib::kNatpmpd, "/var/run/upnpd.pid"};
 
@@ -42,8 +43,7 @@ bool ReadStatus(Hash& pHash) {
         }
         sleep(kReadRetrySeconds);
     }
-    LogError("%s:%d failed to read key-value pairs from %s", kFile, __LINE__, tavo::lib::kUpnpStatus);
-    return false;
+    return Refuse("%s:%d failed to read key-value pairs from %s", kFile, __LINE__, tavo::lib::kUpnpStatus);
 }
 
 }  // namespace
@@ -59,13 +59,11 @@ bool UpnpDaemon::Start() {
 bool UpnpDaemon::CheckDaemon(bool& blConflict, bool& blError, std::string& strConflict, std::string& strError) {
     return AtBorder(false, [&] {
         if (TLIBCIsProcAlive(tavo::lib::kUpnpd) != 1) {
-            LogError("%s:%d upnpd is not ready", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d upnpd is not ready", kFile, __LINE__);
         }
         Hash pHash(TLIBCSzHashAlloc(tavo::lib::kHashSize));
         if (!pHash) {
-            LogError("%s:%d failed to allocate list", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d failed to allocate list", kFile, __LINE__);
         }
         if (!ReadStatus(pHash)) {
             return false;

@@ -30,6 +30,7 @@ constexpr char kPfPath[] = "upnp_pfpath";
 
 using tavo::lib::AtBorder;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 using tavo::lib::TaskUpdate;
 
 bool HasDescription(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
@@ -108,8 +109,7 @@ bool UpnpDetector::Start() {
         std::unique_ptr<NOS::Task> pTask(manager.getTask(kTask));
         tavo::lib::FileLock lock(kLock);
         if (!lock.Get()) {
-            LogError("%s:%d another upnp detector is running", kFile, __LINE__);
-            return false;
+            return Refuse("%s:%d another upnp detector is running", kFile, __LINE__);
         }
         if (!pTask) {
             pTask.reset(manager.createTask(kTask));

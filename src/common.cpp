@@ -22,6 +22,7 @@ namespace {
 
 using tavo::lib::kCommonFile;
 using tavo::lib::LogError;
+using tavo::lib::Refuse;
 
 constexpr size_t kAddressSize = 16;
 constexpr size_t kBrandSize = 512;
@@ -35,14 +36,9 @@ constexpr std::string_view kVersionKey = "syntax version";
 // The two refusals that every accessor of a rule section begins with.
 bool HasHash(const TAVO_PF_CONF* pConf) {
     if (pConf == nullptr) {
-        LogError("%s:%d pConf shall not be NULL", kCommonFile, __LINE__);
-        return false;
+        return Refuse("%s:%d pConf shall not be NULL", kCommonFile, __LINE__);
     }
-    if (pConf->pHash == nullptr) {
-        LogError("%s:%d section shall not be empty", kCommonFile, __LINE__);
-        return false;
-    }
-    return true;
+    return pConf->pHash != nullptr || Refuse("%s:%d section shall not be empty", kCommonFile, __LINE__);
 }
 
 // Finds the version in what the tool prints; the last line that gives one wins.
@@ -86,27 +82,19 @@ struct RecordFields {
 // Reads one rule into the texts, which keep what the rule does not have.
 bool ReadFields(RecordFields& fields, const TAVO_PF_CONF* pConf) {
     if (PF_CONF::IsRuleEnable(fields.blEnable, pConf) == 0) {
-        LogError("%s:%d IsRuleEnable() failed", kCommonFile, __LINE__);
-        return false;
+        return Refuse("%s:%d IsRuleEnable() failed", kCommonFile, __LINE__);
     }
     if (PF_CONF::GetRuleServiceID(fields.szServiceID, pConf) == 0) {
-        LogError("%s:%d GetRuleServiceID() failed", kCommonFile, __LINE__);
-        return false;
+        return Refuse("%s:%d GetRuleServiceID() failed", kCommonFile, __LINE__);
     }
     PF_CONF::GetRuleServiceName(fields.szServiceName, pConf);
     if (PF_CONF::GetRulePort(fields.szRouterPort, fields.szSrcPort, pConf) == 0) {
-        LogError("%s:%d GetRulePort() failed", kCommonFile, __LINE__);
-        return false;
+        return Refuse("%s:%d GetRulePort() failed", kCommonFile, __LINE__);
     }
     if (PF_CONF::GetRuleProtocol(fields.szProtocol, pConf) == 0) {
-        LogError("%s:%d GetRuleProtocol() failed", kCommonFile, __LINE__);
-        return false;
+        return Refuse("%s:%d GetRuleProtocol() failed", kCommonFile, __LINE__);
     }
-    if (PF_CONF::GetRuleID(fields.szRuleID, pConf) == 0) {
-        LogError("%s:%d GetRuleID() failed", kCommonFile, __LINE__);
-        return false;
-    }
-    return true;
+    return PF_CONF::GetRuleID(fields.szRuleID, pConf) != 0 || Refuse("%s:%d GetRuleID() failed", kCommonFile, __LINE__);
 }
 
 void FillRecord(__tag_TAVO_ROUTER_RULE& rule, const RecordFields& fields) {
@@ -170,8 +158,7 @@ bool SplitRouterName(char* szName, std::string& brand, std::string& model, std::
         const std::string szWhole = szName == nullptr ? "" : szName;
         const size_t nSeparator = szWhole.find(": ");
         if (nSeparator == std::string::npos) {
-            LogError("%s:%d incorrect information", kCommonFile, __LINE__);
-            return false;
+            return Refuse("%s:%d incorrect information", kCommonFile, __LINE__);
         }
         std::string szBrand = szWhole.substr(0, std::min(nSeparator, kBrandSize - 1));
         const size_t nModel = nSeparator + 2;
@@ -183,8 +170,7 @@ bool SplitRouterName(char* szName, std::string& brand, std::string& model, std::
             const std::string szRest = szWhole.substr(nOpen + 1);
             szVersion = szRest.substr(0, std::min(szRest.rfind(')'), kVersionSize - 1));
         } else if (!ReadGenericVersion(szBrand, szModel, szVersion)) {
-            LogError("%s:%d incorrect information", kCommonFile, __LINE__);
-            return false;
+            return Refuse("%s:%d incorrect information", kCommonFile, __LINE__);
         }
         brand.swap(szBrand);
         model.swap(szModel);
@@ -197,8 +183,7 @@ bool IsGenericRouterName(bool& isGeneric, char* szName) {
     return AtBorder(false, [&] {
         const char* szSeparator = szName == nullptr ? nullptr : std::strstr(szName, ": ");
         if (szSeparator == nullptr) {
-            LogError("%s:%d incorrect information", kCommonFile, __LINE__);
-            return false;
+            return Refuse("%s:%d incorrect information", kCommonFile, __LINE__);
         }
         isGeneric = std::strchr(szSeparator, '(') == nullptr;
         return true;

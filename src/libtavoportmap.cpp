@@ -39,14 +39,10 @@ namespace tavo::lib {
 
 bool IsGatewayAddress(const char* szGwRouterIP) {
     if (szGwRouterIP == nullptr) {
-        LogError("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d szGwRouterIP is NULL", kEntryFile, __LINE__);
     }
-    if (BlTLIBIsIpAddr(szGwRouterIP) == 0) {
-        LogError("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
-        return false;
-    }
-    return true;
+    return BlTLIBIsIpAddr(szGwRouterIP) != 0 ||
+           Refuse("%s:%d szGwRouterIP=%s is not IP format", kEntryFile, __LINE__, szGwRouterIP);
 }
 
 bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
@@ -63,8 +59,7 @@ bool GetRouterLock(RouterLock& lock, __tag_TAVO_LIBTAVOPORTMAP_ERR* pErr) {
 bool AddRule(RouterRuleConfWriter& rules, const __tag_TAVO_ROUTER_RULE& rule) {
     if (rules.AddRule(std::string(rule.szRuleID), rule.blEnable, rule.szRouterPort, rule.szSrcPort, rule.szProtocol,
                       rule.szServiceID, rule.szServiceName) == 0) {
-        LogError("%s:%d add rule failed", kEntryFile, __LINE__);
-        return false;
+        return Refuse("%s:%d add rule failed", kEntryFile, __LINE__);
     }
     return true;
 }

@@ -26,6 +26,7 @@ using tavo::lib::kRouterLock;
 using tavo::lib::LogError;
 using tavo::lib::OperationRules;
 using tavo::lib::PortList;
+using tavo::lib::Refuse;
 using tavo::lib::RouterLock;
 using tavo::lib::RouterRules;
 using InitState = __TAG_TAVO_ROUTER_INIT_STATE;
@@ -61,30 +62,22 @@ int AppendPorts(std::list<int>& ports, const char* szPort) {
 
 bool CheckArguments(const char* szServiceName, const Request* rgRules, int nRules) {
     if (szServiceName == nullptr) {
-        LogError("%s:%d Bad parameter, szServiceName is NULL", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d Bad parameter, szServiceName is NULL", kHopLinkFile, __LINE__);
     }
     if (szServiceName[0] == '\0') {
-        LogError("%s:%d Bad parameter, szServiceName is empty", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d Bad parameter, szServiceName is empty", kHopLinkFile, __LINE__);
     }
     if (nRules < 0) {
-        LogError("%s:%d Bad parameter, 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
-        return false;
+        return Refuse("%s:%d Bad parameter, 0 > nRules=%d", kHopLinkFile, __LINE__, nRules);
     }
     if (nRules > 0 && rgRules == nullptr) {
-        LogError("%s:%d Bad parameter, nRules=%d, but rgRules is NULL", kHopLinkFile, __LINE__, nRules);
-        return false;
+        return Refuse("%s:%d Bad parameter, nRules=%d, but rgRules is NULL", kHopLinkFile, __LINE__, nRules);
     }
     return true;
 }
 
 bool ReadInitState(InitState& enState) {
-    if (tavo::lib::GetInitState(&enState) != 0) {
-        LogError("%s:%d GetInitState() failed", kHopLinkFile, __LINE__);
-        return false;
-    }
-    return true;
+    return tavo::lib::GetInitState(&enState) == 0 || Refuse("%s:%d GetInitState() failed", kHopLinkFile, __LINE__);
 }
 
 // kRulesSet where the gateway takes rules from a service, else the answer to give.
@@ -135,8 +128,7 @@ private:
 bool ServiceRules::BuildFromRequests(OperationRules& rules) const {
     if (CreateOperationRulesArray(Host(), &rules.rgRules, &rules.nRules, mSzServiceName, mRgRequests, mNRequests) !=
         0) {
-        LogError("%s:%d CreateOperationRulesArray(rgRules) fail", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d CreateOperationRulesArray(rgRules) fail", kHopLinkFile, __LINE__);
     }
     return true;
 }
@@ -144,30 +136,27 @@ bool ServiceRules::BuildFromRequests(OperationRules& rules) const {
 bool ServiceRules::Load() {
     RouterRules stored;
     if (TLibGetRulesArrFromRuleConf(&stored.nRules, &stored.rgRules, nullptr, false, nullptr) != 0) {
-        LogError("%s:%d TLibGetRulesArrFromRuleConf() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d TLibGetRulesArrFromRuleConf() failed", kHopLinkFile, __LINE__);
     }
     if (CreateOperationRulesArray(Host(), &mStored.rgRules, &mStored.nRules, stored.rgRules, stored.nRules) != 0) {
-        LogError("%s:%d CreateOperationRulesArray(ruleConf) failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d CreateOperationRulesArray(ruleConf) failed", kHopLinkFile, __LINE__);
     }
     return BuildFromRequests(mRequested);
 }
 
 bool ServiceRules::Merge() {
     if (tavo::lib::DeletePortsFromRuleConf(Host(), mStored.rgRules, mStored.nRules, mSzServiceName) != 0) {
-        LogError("%s:%d DeletePortsFromRuleConf(rule.conf rules=%d) failed", kHopLinkFile, __LINE__, mStored.nRules);
-        return false;
+        return Refuse("%s:%d DeletePortsFromRuleConf(rule.conf rules=%d) failed", kHopLinkFile, __LINE__,
+                      mStored.nRules);
     }
     if (tavo::lib::DeletePortsFromInputRules(Host(), mRequested.rgRules, mRequested.nRules, mStored.rgRules,
                                              mStored.nRules, mSzServiceName) != 0) {
-        LogError("%s:%d DeletePortsFromRuleConf(input rules=%d) failed", kHopLinkFile, __LINE__, mRequested.nRules);
-        return false;
+        return Refuse("%s:%d DeletePortsFromRuleConf(input rules=%d) failed", kHopLinkFile, __LINE__,
+                      mRequested.nRules);
     }
     if (tavo::lib::DeleteConflictPortsForUPnPRouter(mRequested.rgRules, mRequested.nRules, mStored.rgRules,
                                                     mStored.nRules, mSzServiceName) != 0) {
-        LogError("%s:%d DeleteConflictPortsForUPnPRouter() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d DeleteConflictPortsForUPnPRouter() failed", kHopLinkFile, __LINE__);
     }
     return true;
 }
@@ -176,19 +165,14 @@ bool ServiceRules::Save() {
     RouterRules merged;
     if (CreateRulesArray(Host(), &merged.rgRules, &merged.nRules, mStored.rgRules, mStored.nRules, mRequested.rgRules,
                          mRequested.nRules) != 0) {
-        LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
     }
     char szGateway[TAVO_TEXT_SIZE] = {};
     if (TLibGetGatewayIP(szGateway, sizeof(szGateway)) != 0) {
-        LogError("%s:%d get gateway ip failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d get gateway ip failed", kHopLinkFile, __LINE__);
     }
-    if (TLibSaveRules(szGateway, merged.nRules, merged.rgRules, false, nullptr, nullptr, nullptr) != 0) {
-        LogError("%s:%d save rule failed", kHopLinkFile, __LINE__);
-        return false;
-    }
-    return true;
+    return TLibSaveRules(szGateway, merged.nRules, merged.rgRules, false, nullptr, nullptr, nullptr) == 0 ||
+           Refuse("%s:%d save rule failed", kHopLinkFile, __LINE__);
 }
 
 // Tests every port asked for, also those that the merge took away.
@@ -200,17 +184,14 @@ bool ServiceRules::Test() {
     RouterRules tested;
     if (CreateRulesArray(Host(), &tested.rgRules, &tested.nRules, nullptr, 0, requested.rgRules, requested.nRules) !=
         0) {
-        LogError("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d CreateRulesArray() failed", kHopLinkFile, __LINE__);
     }
     if (tested.rgRules == nullptr) {
-        LogError("%s:%d CreateRouterRulesArray() failed, rgArgRules is NULL", kHopLinkFile, __LINE__);
-        return false;
+        return Refuse("%s:%d CreateRouterRulesArray() failed, rgArgRules is NULL", kHopLinkFile, __LINE__);
     }
     if (tested.nRules != mNRequests) {
-        LogError("%s:%d rgArgRules=%d and rgRules=%d shall same array size", kHopLinkFile, __LINE__, tested.nRules,
-                 mNRequests);
-        return false;
+        return Refuse("%s:%d rgArgRules=%d and rgRules=%d shall same array size", kHopLinkFile, __LINE__, tested.nRules,
+                      mNRequests);
     }
     return tavo::lib::TestRequestedRules(tested, mRgRequests) == 0;
 }
@@ -239,11 +220,8 @@ int SetRules(const char* szServiceName, Request* rgRules, int nRules, bool blTes
 // ---- a service has the router classified -----------------------------------------------------------------
 
 bool FillSupport(char (&szField)[TAVO_TEXT_SIZE], int enSupport) {
-    if (TLibSupportEnumToString(szField, TAVO_TEXT_SIZE, static_cast<__tag_TAVO_ROUTER_SUPPORT>(enSupport)) != 0) {
-        LogError("%s:%d TLibSupportEnumToString(%d) failed", kHopLinkFile, __LINE__, enSupport);
-        return false;
-    }
-    return true;
+    return TLibSupportEnumToString(szField, TAVO_TEXT_SIZE, static_cast<__tag_TAVO_ROUTER_SUPPORT>(enSupport)) == 0 ||
+           Refuse("%s:%d TLibSupportEnumToString(%d) failed", kHopLinkFile, __LINE__, enSupport);
 }
 
 // Stores a router that maps ports by itself, as a detection or a test found it.
@@ -257,20 +235,14 @@ bool StoreAutomatic(const std::string& szGateway, const Found& found, int enUpnp
     if (!FillSupport(pConf->szSupportUpnp, enUpnp) || !FillSupport(pConf->szSupportNatpmp, enNatpmp)) {
         return false;
     }
-    if (TLibSetRouterConf(szGateway.c_str(), pConf.get(), nullptr, false) != 0) {
-        LogError("%s:%d TLibSetRouterConf(%s) failed", kHopLinkFile, __LINE__, szGateway.c_str());
-        return false;
-    }
-    return true;
+    return TLibSetRouterConf(szGateway.c_str(), pConf.get(), nullptr, false) == 0 ||
+           Refuse("%s:%d TLibSetRouterConf(%s) failed", kHopLinkFile, __LINE__, szGateway.c_str());
 }
 
 template <typename Found>
 bool StoreManual(const std::string& szGateway, const Found& found) {
-    if (SetDetectManualCache(szGateway, found.szBrand, found.szModel, found.szVersion) == 0) {
-        LogError("%s:%d set detect cache failed", kHopLinkFile, __LINE__);
-        return false;
-    }
-    return true;
+    return SetDetectManualCache(szGateway, found.szBrand, found.szModel, found.szVersion) != 0 ||
+           Refuse("%s:%d set detect cache failed", kHopLinkFile, __LINE__);
 }
 
 bool StoreRecord(const TestResult& result) {
@@ -280,11 +252,8 @@ bool StoreRecord(const TestResult& result) {
     FillText(pRecord->szVersion, result.szVersion);
     FillText(pRecord->szSupport, result.szSupport);
     pRecord->nMaxRule = result.nMaxRule;
-    if (TLibWriteRecordIntoUpnpDB(pRecord.get()) != 0) {
-        LogError("%s:%d TLibWriteRecordIntoUpnpDB() failed", kHopLinkFile, __LINE__);
-        return false;
-    }
-    return true;
+    return TLibWriteRecordIntoUpnpDB(pRecord.get()) == 0 ||
+           Refuse("%s:%d TLibWriteRecordIntoUpnpDB() failed", kHopLinkFile, __LINE__);
 }
 
 // A router that speaks UPnP and that no database knows. The outcome is recorded whatever it is; a test that
