@@ -3,7 +3,7 @@
 
 #include <exception>
 
-#include "tavo/core.h"
+#include "ground/Fail.h"
 
 namespace tavo {
 
@@ -12,7 +12,7 @@ Result AtBorder(Result failure, Function fnAnswer) noexcept {
     try {
         return fnAnswer();
     } catch (const std::exception&) {
-        TLIBCErrSet(TLIBC_ERR_NO_MEMORY, "ground/Border.h", __LINE__);
+        SetError(TLIBC_ERR_NO_MEMORY);
         return failure;
     }
 }

@@ -7,15 +7,10 @@
 #include <new>
 #include <optional>
 
+#include "ground/Fail.h"
 #include "ground/SysLog.h"
 
 namespace tavo {
-
-namespace {
-
-constexpr char kFile[] = "ground/ConfList.cpp";
-
-}  // namespace
 
 ConfList MakeConfList(const std::vector<Section>& rgSections) {
     ConfList pHead;
@@ -57,11 +52,10 @@ ConfList LoadConfList(const char* szPath) {
     if (!blFits) {
         SysLog(LOG_ERR, "%s: too many sections, or a name over %d bytes; the file is left alone and not used", szPath,
                TAVO_PF_NAME_SIZE - 1);
-        TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
-        return nullptr;
+        return Fail(TLIBC_ERR_FORMAT, nullptr);
     }
     ConfList pList = MakeConfList(*rgSections);
-    TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
+    SetError(TLIBC_ERR_NONE);
     return pList;
 }
 

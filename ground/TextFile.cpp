@@ -13,6 +13,7 @@
 #include <memory>
 
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/Suffix.h"
 #include "ground/SysLog.h"
 #include "tavo/core.h"
@@ -21,14 +22,8 @@ namespace tavo {
 
 namespace {
 
-constexpr char kFile[] = "ground/TextFile.cpp";
 constexpr char kHexDigits[] = "0123456789abcdef";
 constexpr mode_t kDirectoryMode = 0755;
-
-bool Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return false;
-}
 
 bool IsBlank(char c) {
     return c == ' ' || c == '\t' || c == '\r';
@@ -243,7 +238,7 @@ std::string Resolve(const std::string& szPath) {
 bool FlushDirectory(const std::string& szDir) {
     const Descriptor fd(open(szDir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     const bool blFlushed = fd.Get() >= 0 && (fsync(fd.Get()) == 0 || errno == EINVAL || errno == ENOTSUP);
-    return blFlushed || Fail(TLIBC_ERR_WRITE, __LINE__);
+    return blFlushed || Fail(TLIBC_ERR_WRITE, false);
 }
 
 bool KeepOwnerAndMode(int fd, const std::string& szTarget, mode_t nNewMode) {
@@ -273,11 +268,11 @@ std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost) {
     const Descriptor fd(open(szPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
     struct stat status = {};
     if (fd.Get() < 0) {
-        Fail(errno == ENOENT ? TLIBC_ERR_NOT_FOUND : TLIBC_ERR_OPEN, __LINE__);
+        SetError(errno == ENOENT ? TLIBC_ERR_NOT_FOUND : TLIBC_ERR_OPEN);
         return std::nullopt;
     }
     if (fstat(fd.Get(), &status) != 0 || !S_ISREG(status.st_mode)) {
-        Fail(TLIBC_ERR_OPEN, __LINE__);
+        SetError(TLIBC_ERR_OPEN);
         return std::nullopt;
     }
     std::string szText;
@@ -288,7 +283,7 @@ std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost) {
             continue;
         }
         if (nRead < 0 || szText.size() + static_cast<size_t>(nRead) > nMost) {
-            Fail(TLIBC_ERR_READ, __LINE__);
+            SetError(TLIBC_ERR_READ);
             return std::nullopt;
         }
         if (nRead == 0) {
@@ -301,20 +296,20 @@ std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost) {
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode,
                      const std::function<bool(int fd)>& fnWhole, size_t nMost) {
     if (szText.size() > nMost) {
-        return Fail(TLIBC_ERR_WRITE, __LINE__);
+        return Fail(TLIBC_ERR_WRITE, false);
     }
     const std::string szTarget = Resolve(szPath);
     const std::string szDir = DirectoryOf(szTarget);  // beforehand: nothing may fail any more after the renaming
     NewFile file(szTarget);
     if (file.Fd() < 0) {
-        return Fail(TLIBC_ERR_OPEN, __LINE__);
+        return Fail(TLIBC_ERR_OPEN, false);
     }
     if (!KeepOwnerAndMode(file.Fd(), szTarget, nNewMode) || !WriteAll(file.Fd(), szText) || fsync(file.Fd()) != 0 ||
         (fnWhole && !fnWhole(file.Fd()))) {
-        return Fail(TLIBC_ERR_WRITE, __LINE__);
+        return Fail(TLIBC_ERR_WRITE, false);
     }
     if (!file.Rename(szTarget)) {
-        return Fail(TLIBC_ERR_RENAME, __LINE__);
+        return Fail(TLIBC_ERR_RENAME, false);
     }
     return FlushDirectory(szDir);
 }
@@ -325,9 +320,9 @@ bool FlushDirectoryOf(const std::string& szPath) {
 
 bool MakeDirectory(const std::string& szDir) {
     if (mkdir(szDir.c_str(), kDirectoryMode) != 0) {
-        return errno == EEXIST || Fail(TLIBC_ERR_OPEN, __LINE__);
+        return errno == EEXIST || Fail(TLIBC_ERR_OPEN, false);
     }
-    return chmod(szDir.c_str(), kDirectoryMode) == 0 ? FlushDirectoryOf(szDir) : Fail(TLIBC_ERR_OPEN, __LINE__);
+    return chmod(szDir.c_str(), kDirectoryMode) == 0 ? FlushDirectoryOf(szDir) : Fail(TLIBC_ERR_OPEN, false);
 }
 
 std::string_view Trim(std::string_view szText) {
@@ -360,7 +355,7 @@ std::optional<std::vector<Section>> ParseSections(std::string_view szText, size_
     for (const std::string_view szLine : SplitLines(szText)) {
         ++nLine;
         if (!ParseLine(Trim(szLine), rgSections)) {
-            Fail(TLIBC_ERR_FORMAT, __LINE__);
+            SetError(TLIBC_ERR_FORMAT);
             if (pnBadLine != nullptr) {
                 *pnBadLine = nLine;
             }

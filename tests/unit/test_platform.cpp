@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <functional>
 #include <thread>
+#include <utility>
 
 #include "ground/OwnFile.h"
 #include "ground/PortText.h"
@@ -16,6 +17,7 @@
 #include "ground/TextFile.h"
 #include "programs/tavohook/Hooks.h"
 #include "tavo/core.h"
+#include "tavo/net.h"
 #include "tavo/portforward.h"
 #include "world.h"
 
@@ -120,6 +122,25 @@ TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {
     std::filesystem::remove("/etc/portforward/rule.conf");
     EXPECT_EQ(TAVOPFRuleGet(), nullptr);
     EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_NOT_FOUND);
+}
+
+// The library logs all three: a place in a helper, or one on the machine that built it, leads nobody to the fault.
+TEST(LastError, NamesThePlaceInTheTreeThatFailed) {
+    const std::pair<std::function<void()>, const char*> rgCases[] = {
+        {[] { TLIBCFileSetKeyValue(nullptr, "k", "v", nullptr); }, "platform/linux/core/File.cpp"},
+        {[] { TAVONetGetCard1(0, nullptr); }, "platform/linux/net/Cards.cpp"},
+        {[] { tavo::ReadFile("/tmp/t/nowhere"); }, "ground/TextFile.cpp"},
+        {[] { TLIBCSzHashCount(nullptr); }, "platform/linux/core/Hash.cpp"},
+        {[] { TLIBCSzListCount(nullptr); }, "platform/linux/core/Hash.cpp"}};
+    int nLineBefore = 0;
+    for (const auto& [fnFail, szFile] : rgCases) {
+        TLIBCErrSet(TLIBC_ERR_NONE, nullptr, 0);
+        fnFail();
+        EXPECT_NE(TLIBCErrGet(), TLIBC_ERR_NONE) << szFile;
+        EXPECT_STREQ(TLIBCErrorGetFile(), szFile);
+        EXPECT_GT(TLIBCErrorGetLine(), 0) << szFile;
+        EXPECT_NE(TLIBCErrorGetLine(), std::exchange(nLineBefore, TLIBCErrorGetLine())) << szFile;
+    }
 }
 
 TEST(SystemLog, ALineStaysOneLineOfPlainText) {

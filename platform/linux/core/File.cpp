@@ -14,6 +14,7 @@
 #include "core/RunKeys.h"
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/FileLock.h"
 #include "ground/TextFile.h"
 #include "portforward/Aside.h"
@@ -21,16 +22,11 @@
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/core/File.cpp";
 constexpr char kKeyFormat[] = "%s=\"%s\"\n";
 constexpr mode_t kKeyFileMode = 0644;
 
 using tavo::AtBorder;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
+using tavo::Fail;
 
 void CopyOut(const std::string& szText, char* szValue, int nSize) {
     std::snprintf(szValue, static_cast<size_t>(nSize), "%s", szText.c_str());
@@ -123,12 +119,12 @@ int TLIBCFileExist(const char* szPath) {
 
 int TLIBCFileTouch(const char* szPath) {
     if (szPath == nullptr) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER);
     }
     // /tmp is everybody's: a link planted there must not make us write elsewhere.
     const tavo::Descriptor fd(open(szPath, O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, kKeyFileMode));
     if (fd.Get() < 0 || futimens(fd.Get(), nullptr) != 0) {
-        return Fail(TLIBC_ERR_OPEN, __LINE__);
+        return Fail(TLIBC_ERR_OPEN);
     }
     return 0;
 }
@@ -136,7 +132,7 @@ int TLIBCFileTouch(const char* szPath) {
 int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* pHash) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || szSection == nullptr || pHash == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const auto rgSections = tavo::LoadSections(szPath);
         if (!rgSections) {
@@ -158,7 +154,7 @@ int TLIBCFileGetSection(const char* szPath, const char* szSection, TLIBCSzHash* 
 int TLIBCFileAddSection(const char* szPath, const char* szSection, const TLIBCSzHash* pHash, int /*nFlags*/) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || szSection == nullptr || pHash == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const DirectoryLock lock(szPath);
         std::vector<tavo::Section> rgSections;
@@ -190,7 +186,7 @@ int TLIBCFileAddSection(const char* szPath, const char* szSection, const TLIBCSz
 int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const char* szKey, char* szValue, int nSize) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || szSection == nullptr || szKey == nullptr || szValue == nullptr || nSize < 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const auto rgSections = tavo::LoadSections(szPath);
         if (!rgSections) {
@@ -198,13 +194,13 @@ int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const ch
         }
         const auto section = tavo::FindSection(*rgSections, szSection);
         if (!section) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         // The last of two pairs with one key counts, as in a hash.
         const auto it = std::find_if(section->rgPairs.rbegin(), section->rgPairs.rend(),
                                      [szKey](const tavo::Pair& pair) { return pair.szKey == szKey; });
         if (it == section->rgPairs.rend()) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         CopyOut(it->szValue, szValue, nSize);
         return 0;
@@ -214,7 +210,7 @@ int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const ch
 int TLIBCFileGetKeyValue(const char* szPath, const char* szKey, char* szValue, int nSize, int /*nFlags*/) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || szKey == nullptr || szValue == nullptr || nSize < 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::optional<std::string> szText = tavo::ReadFile(szPath);
         if (!szText) {
@@ -227,7 +223,7 @@ int TLIBCFileGetKeyValue(const char* szPath, const char* szKey, char* szValue, i
             }
         }
         if (!szFound) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         CopyOut(*szFound, szValue, nSize);
         return 1;
@@ -239,7 +235,7 @@ int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szVa
         const char* szLineFormat = szFormat == nullptr ? kKeyFormat : szFormat;
         if (szPath == nullptr || szKey == nullptr || szValue == nullptr || !IsPlainKey(szKey) ||
             !IsKeyFormat(szLineFormat)) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const DirectoryLock lock(szPath);
         std::string szText;
@@ -259,7 +255,7 @@ int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szVa
 int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppHash, const char* szSeparator) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || ppHash == nullptr || szSeparator == nullptr || *szSeparator == '\0') {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::optional<std::string> szText = tavo::ReadFile(szPath);
         if (!szText) {

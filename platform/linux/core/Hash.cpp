@@ -8,21 +8,15 @@
 #include <vector>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "tavo/core.h"
 
 namespace {
-
-constexpr char kFile[] = "platform/linux/core/Hash.cpp";
 
 struct Entry {
     std::string szKey;
     std::optional<std::string> szValue;
 };
-
-int BadParameter(int nLine) {
-    TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, nLine);
-    return -1;
-}
 
 }  // namespace
 
@@ -36,12 +30,12 @@ struct tag_TLIBC_SZLIST {
 };
 
 using tavo::AtBorder;
+using tavo::Fail;
 
 TLIBCSzHash* TLIBCSzHashAlloc(int nSize) {
     return AtBorder(static_cast<TLIBCSzHash*>(nullptr), [nSize] {
         if (nSize < 0) {
-            BadParameter(__LINE__);
-            return static_cast<TLIBCSzHash*>(nullptr);
+            return Fail(TLIBC_ERR_BAD_PARAMETER, static_cast<TLIBCSzHash*>(nullptr));
         }
         return std::make_unique<TLIBCSzHash>().release();  // the size is a hint; most sections are small
     });
@@ -54,8 +48,7 @@ void TLIBCSzHashFree(TLIBCSzHash* pHash) {
 const char* TLIBCSzHashGetValue(const TLIBCSzHash* pHash, const char* szKey) {
     return AtBorder(static_cast<const char*>(nullptr), [&]() -> const char* {
         if (pHash == nullptr || szKey == nullptr) {
-            BadParameter(__LINE__);
-            return nullptr;
+            return Fail(TLIBC_ERR_BAD_PARAMETER, nullptr);
         }
         const auto it = pHash->mapIndex.find(szKey);
         if (it == pHash->mapIndex.end() || !pHash->rgEntries[it->second].szValue) {
@@ -68,7 +61,7 @@ const char* TLIBCSzHashGetValue(const TLIBCSzHash* pHash, const char* szKey) {
 int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szValue) {
     return AtBorder(-1, [&] {
         if (pHash == nullptr || szKey == nullptr || *szKey == '\0') {
-            return BadParameter(__LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         std::optional<std::string> szCopy;
         if (szValue != nullptr) {
@@ -92,7 +85,7 @@ int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szVal
 }
 
 int TLIBCSzHashCount(const TLIBCSzHash* pHash) {
-    return pHash == nullptr ? BadParameter(__LINE__) : static_cast<int>(pHash->rgEntries.size());
+    return pHash == nullptr ? Fail(TLIBC_ERR_BAD_PARAMETER) : static_cast<int>(pHash->rgEntries.size());
 }
 
 int TLIBCSzHashGetAt(const TLIBCSzHash* pHash, int nIndex, const char** pszKey, const char** pszValue) {
@@ -109,8 +102,7 @@ int TLIBCSzHashGetAt(const TLIBCSzHash* pHash, int nIndex, const char** pszKey, 
 TLIBCSzList* TLIBCSzListAlloc(int nSize) {
     return AtBorder(static_cast<TLIBCSzList*>(nullptr), [nSize] {
         if (nSize < 0) {
-            BadParameter(__LINE__);
-            return static_cast<TLIBCSzList*>(nullptr);
+            return Fail(TLIBC_ERR_BAD_PARAMETER, static_cast<TLIBCSzList*>(nullptr));
         }
         return std::make_unique<TLIBCSzList>().release();
     });
@@ -123,7 +115,7 @@ void TLIBCSzListFree(TLIBCSzList* pList) {
 int TLIBCSzListPush(TLIBCSzList* pList, const char* szItem) {
     return AtBorder(-1, [&] {
         if (pList == nullptr || szItem == nullptr) {
-            return BadParameter(__LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         pList->rgItems.emplace_back(szItem);
         return 1;
@@ -138,5 +130,5 @@ const char* TLIBCSzListGet(const TLIBCSzList* pList, int nIndex) {
 }
 
 int TLIBCSzListCount(const TLIBCSzList* pList) {
-    return pList == nullptr ? BadParameter(__LINE__) : static_cast<int>(pList->rgItems.size());
+    return pList == nullptr ? Fail(TLIBC_ERR_BAD_PARAMETER) : static_cast<int>(pList->rgItems.size());
 }

@@ -18,6 +18,7 @@
 
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/Spawn.h"
 #include "ground/TextFile.h"
 #include "ground/Unit.h"
@@ -27,18 +28,13 @@ extern char** environ;
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/core/Proc.cpp";
 constexpr size_t kKernelNameSize = 15;
 constexpr int kSignalledStatus = 128;
 constexpr int kLostStatus = 255;  // the caller ignores SIGCHLD: the child has ended, nobody knows how
 
 using tavo::AtBorder;
 using tavo::Descriptor;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
+using tavo::Fail;
 
 struct DirCloser {
     void operator()(DIR* pDir) const { closedir(pDir); }
@@ -181,13 +177,13 @@ int WaitFor(pid_t pid) {
 int Launch(char* const* rgszArguments) {
     int rgFdPipe[2];
     if (pipe2(rgFdPipe, O_CLOEXEC) != 0) {
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
+        return Fail(TLIBC_ERR_EXEC);
     }
     Descriptor fdRead(rgFdPipe[0]);
     Descriptor fdWrite(rgFdPipe[1]);
     const pid_t pid = fork();
     if (pid < 0) {
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
+        return Fail(TLIBC_ERR_EXEC);
     }
     if (pid == 0) {
         // A child of a child belongs to init, which takes care of its end.
@@ -210,7 +206,7 @@ int Launch(char* const* rgszArguments) {
     // The pipe alone tells: a caller that ignores SIGCHLD gets no exit status.
     if (nRead != 0) {
         errno = nErrno;
-        return Fail(TLIBC_ERR_EXEC, __LINE__);
+        return Fail(TLIBC_ERR_EXEC);
     }
     return 0;
 }
@@ -220,11 +216,11 @@ int Launch(char* const* rgszArguments) {
 int TLIBCIsProcAlive(const char* szName) {
     return AtBorder(-1, [&] {
         if (szName == nullptr || *szName == '\0') {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         bool blAlive = false;
         if (!ForEachProcess(szName, [&blAlive](pid_t) { blAlive = true; })) {
-            return Fail(TLIBC_ERR_READ, __LINE__);
+            return Fail(TLIBC_ERR_READ);
         }
         return blAlive ? 1 : 0;
     });
@@ -233,7 +229,7 @@ int TLIBCIsProcAlive(const char* szName) {
 int TLIBCKill(const char* szName, int nSignal) {
     return AtBorder(-1, [&] {
         if (szName == nullptr || *szName == '\0' || nSignal < 0 || nSignal >= NSIG) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         int nSignalled = 0;
         const bool blRead = ForEachProcess(szName, [&](pid_t pid) {
@@ -241,29 +237,29 @@ int TLIBCKill(const char* szName, int nSignal) {
                 ++nSignalled;
             }
         });
-        return blRead ? nSignalled : Fail(TLIBC_ERR_READ, __LINE__);
+        return blRead ? nSignalled : Fail(TLIBC_ERR_READ);
     });
 }
 
 pid_t TLIBCReadPidFile(const char* szPath) {
     return AtBorder(pid_t{-1}, [&] {
         if (szPath == nullptr) {
-            return pid_t{Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__)};
+            return pid_t{Fail(TLIBC_ERR_BAD_PARAMETER)};
         }
         const std::optional<std::string> szText = tavo::ReadFile(szPath);
         const long nPid = szText ? std::strtol(szText->c_str(), nullptr, 10) : -1;
-        return nPid >= 1 && nPid <= INT32_MAX ? static_cast<pid_t>(nPid) : pid_t{Fail(TLIBC_ERR_NOT_FOUND, __LINE__)};
+        return nPid >= 1 && nPid <= INT32_MAX ? static_cast<pid_t>(nPid) : pid_t{Fail(TLIBC_ERR_NOT_FOUND)};
     });
 }
 
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || *szPath == '\0') {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         // A daemon belongs to the service manager, whoever asks for it.
         if (const std::optional<bool> blUnit = szArg1 == nullptr ? tavo::StartUnitOf(szPath) : std::nullopt) {
-            return *blUnit ? 0 : Fail(TLIBC_ERR_EXEC, __LINE__);
+            return *blUnit ? 0 : Fail(TLIBC_ERR_EXEC);
         }
         const char* rgszGiven[] = {szPath, szArg1, szArg2, szArg3, szArg4, nullptr};
         char* rgszArguments[std::size(rgszGiven)] = {};
@@ -280,12 +276,12 @@ pid_t TLIBCProcFork() {
 
 int TLIBCSystem(const char* szCommand) {
     if (szCommand == nullptr) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER);
     }
     char szShell[] = "sh";
     char szOption[] = "-c";
     char* const rgszArguments[] = {szShell, szOption, const_cast<char*>(szCommand), nullptr};
     pid_t pid = -1;
     tavo::SpawnSetup().Spawn(pid, "/bin/sh", rgszArguments, environ);
-    return pid < 0 ? Fail(TLIBC_ERR_EXEC, __LINE__) : WaitFor(pid);
+    return pid < 0 ? Fail(TLIBC_ERR_EXEC) : WaitFor(pid);
 }

@@ -6,12 +6,14 @@
 #include <string_view>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "ground/Unit.h"
 #include "tavo/core.h"
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/core/Service.cpp";
+using tavo::Fail;
+
 constexpr int kNameSize = 128;
 constexpr char kTimeout[] = "timeout -k 2 28 ";  // for who does not heed the first signal, a second one
 
@@ -54,8 +56,7 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
     return tavo::AtBorder(-1, [&] {
         const std::string szSystem = SystemName(szName);
         if (szSystem.empty()) {
-            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         if (TLIBCFileExist(kSystemd) == 1) {
             return TLIBCSystem((std::string(kTimeout) + "systemctl " + szSystemdVerb + " " + szSystem +
@@ -64,8 +65,7 @@ int Control(const char* szName, const char* szSystemdVerb, const char* szInitVer
         }
         const std::string szScript = "/etc/init.d/" + szSystem;
         if (TLIBCFileExist(szScript.c_str()) != 1) {
-            TLIBCErrSet(TLIBC_ERR_NOT_FOUND, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         return TLIBCSystem((kTimeout + szScript + " " + szInitVerb + " >/dev/null 2>&1 </dev/null").c_str());
     });

@@ -6,22 +6,19 @@
 
 #include "ground/Border.h"
 #include "ground/Catalogue.h"
+#include "ground/Fail.h"
 #include "ground/LogFile.h"
 #include "ground/TextFile.h"
 #include "tavo/log.h"
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/log/EventLog.cpp";
+using tavo::Fail;
+
 constexpr char kDirectory[] = "/var/log/tavo";
 constexpr char kEventLog[] = "/var/log/tavo/event.log";
 constexpr size_t kTextSize = 4096;
 constexpr int kSystemEvents = 1;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 const char* LevelName(int nLevel) {
     switch (nLevel) {
@@ -40,7 +37,7 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
                 const char* szText4) {
     return tavo::AtBorder(-1, [&] {
         if (nKind != kSystemEvents || nLevel < 1 || nLevel > 3) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         char szEvent[16];
         std::snprintf(szEvent, sizeof(szEvent), "0x%08X", nEvent);
@@ -52,6 +49,6 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
             }
         }
         mkdir(kDirectory, 0755);
-        return tavo::AppendLogLine(kEventLog, std::move(szLine)) ? 0 : Fail(TLIBC_ERR_WRITE, __LINE__);
+        return tavo::AppendLogLine(kEventLog, std::move(szLine)) ? 0 : Fail(TLIBC_ERR_WRITE);
     });
 }

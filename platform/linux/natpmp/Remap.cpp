@@ -4,12 +4,14 @@
 #include <cstring>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "ground/TextFile.h"
 #include "tavo/natpmp.h"
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/natpmp/Remap.cpp";
+using tavo::Fail;
+
 constexpr char kRemapFile[] = "/var/tmp/natpmp_portmap.remap";
 
 }  // namespace
@@ -17,8 +19,7 @@ constexpr char kRemapFile[] = "/var/tmp/natpmp_portmap.remap";
 int NetpmpRemapGet(char** ppszRemap, int* pnSize) {
     return tavo::AtBorder(-1, [&] {
         if (ppszRemap == nullptr || *ppszRemap == nullptr || pnSize == nullptr || *pnSize < 1) {
-            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::optional<std::string> szText = tavo::ReadFile(kRemapFile);
         if (!szText) {
@@ -28,8 +29,7 @@ int NetpmpRemapGet(char** ppszRemap, int* pnSize) {
         if (nNeeded > static_cast<size_t>(*pnSize)) {
             void* pGrown = std::realloc(*ppszRemap, nNeeded);
             if (pGrown == nullptr) {
-                TLIBCErrSet(TLIBC_ERR_NO_MEMORY, kFile, __LINE__);
-                return -1;
+                return Fail(TLIBC_ERR_NO_MEMORY);
             }
             *ppszRemap = static_cast<char*>(pGrown);
             *pnSize = static_cast<int>(nNeeded);

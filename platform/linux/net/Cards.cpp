@@ -12,20 +12,16 @@
 #include <vector>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "tavo/net.h"
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/net/Cards.cpp";
 constexpr int kAll = 1;
 constexpr int kInUse = 2;
 
 using tavo::AtBorder;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
+using tavo::Fail;
 
 struct ListFree {
     void operator()(ifaddrs* pList) const { freeifaddrs(pList); }
@@ -77,11 +73,11 @@ std::optional<std::vector<NumberedCard>> Cards(int nKind) {
 int TLIBNetGetInterfaceInfo(TAVO_NET_CARD* rgCards, int nRoom, int nKind) {
     return AtBorder(-1, [&] {
         if (rgCards == nullptr || nRoom < 1 || (nKind != kAll && nKind != kInUse)) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const auto rgFound = Cards(nKind);
         if (!rgFound) {
-            return Fail(TLIBC_ERR_READ, __LINE__);
+            return Fail(TLIBC_ERR_READ);
         }
         const int nFilled = std::min(nRoom, static_cast<int>(rgFound->size()));
         for (int i = 0; i < nFilled; ++i) {
@@ -94,11 +90,11 @@ int TLIBNetGetInterfaceInfo(TAVO_NET_CARD* rgCards, int nRoom, int nKind) {
 int TAVONetGetCard1(int nIndex, TAVO_NET_CARD* pCard) {
     return AtBorder(-1, [&] {
         if (nIndex < 0 || pCard == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const auto rgFound = Cards(kInUse);
         if (!rgFound) {
-            return Fail(TLIBC_ERR_READ, __LINE__);
+            return Fail(TLIBC_ERR_READ);
         }
         if (static_cast<size_t>(nIndex) >= rgFound->size()) {
             return 0;

@@ -13,6 +13,7 @@
 
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/net/Level.h"
 #include "ground/net/Neighbour.h"
 #include "platform/linux/net/Reachability.h"
@@ -23,18 +24,13 @@
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/net/Checks.cpp";
 constexpr int kMostCards = 64;
 constexpr int kWalkMilliseconds = 1500;
 constexpr int kOneHopMilliseconds = 700;
 constexpr int kUpnpMilliseconds = 1500;
 
 using tavo::AtBorder;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
+using tavo::Fail;
 
 // A cable that is not plugged in counts as down.
 bool IsRunning(const std::string& szInterface) {
@@ -170,43 +166,42 @@ std::optional<int> Level(const sockaddr_in& host, int nHops) {
 int checkGwIfEnable(char* szInterface, int nSize) {
     return AtBorder(-1, [&] {
         if (szInterface == nullptr || nSize < 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::vector<TAVO_NET_CARD> rgCards = CardsInUse();
         const std::string szName = InterfaceInQuestion(rgCards);
         std::snprintf(szInterface, static_cast<size_t>(nSize), "%s", szName.c_str());
         const bool blAddressed = std::any_of(rgCards.begin(), rgCards.end(),
                                              [&](const TAVO_NET_CARD& card) { return szName == card.szName; });
-        return blAddressed && IsRunning(szName) ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        return blAddressed && IsRunning(szName) ? 0 : Fail(TLIBC_ERR_NOT_FOUND);
     });
 }
 
 int checkDefaultGatewaySetting(char* szGateway, int nSize) {
     return AtBorder(-1, [&] {
         if (szGateway == nullptr || nSize < 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::string szFound = Gateway();
         std::snprintf(szGateway, static_cast<size_t>(nSize), "%s", szFound.c_str());
         bool blOnLink = false;
         for (const TAVO_NET_CARD& card : CardsInUse()) {
             if (szFound == card.szAddress) {
-                return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);  // the box as its own gateway
+                return Fail(TLIBC_ERR_NOT_FOUND);  // the box as its own gateway
             }
             blOnLink = blOnLink ||
                        (!szFound.empty() && TAVONetIsSameSubnet(szFound.c_str(), card.szAddress, card.szMask) == 1);
         }
-        return blOnLink ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        return blOnLink ? 0 : Fail(TLIBC_ERR_NOT_FOUND);
     });
 }
 
 int checkConnectToWAN() {
-    return AtBorder(-1,
-                    [] { return tavo::AnyReached(tavo::OutsideHosts()) ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__); });
+    return AtBorder(-1, [] { return tavo::AnyReached(tavo::OutsideHosts()) ? 0 : Fail(TLIBC_ERR_NOT_FOUND); });
 }
 
 int checkDNSSetting() {
-    return AtBorder(-1, [] { return tavo::IsNameResolved() ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__); });
+    return AtBorder(-1, [] { return tavo::IsNameResolved() ? 0 : Fail(TLIBC_ERR_NOT_FOUND); });
 }
 
 int getPublicIPLevel(int& nLevel, int nHops) {
@@ -214,7 +209,7 @@ int getPublicIPLevel(int& nLevel, int nHops) {
         const std::vector<sockaddr_in> rgHosts = tavo::OutsideHosts();
         const std::optional<int> level = rgHosts.empty() ? std::nullopt : Level(rgHosts.front(), nHops);
         if (!level) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         nLevel = *level;
         return 0;
@@ -225,7 +220,7 @@ int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
     return AtBorder(-1, [&] {
         const std::string szGateway = Gateway();
         if (pWord == nullptr || szGateway.empty()) {
-            return Fail(pWord == nullptr ? TLIBC_ERR_BAD_PARAMETER : TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(pWord == nullptr ? TLIBC_ERR_BAD_PARAMETER : TLIBC_ERR_NOT_FOUND);
         }
         const tavo::NatPmpWord natpmp = tavo::AskNatPmp(szGateway);
         const auto outside = natpmp.address ? natpmp.address : AskUpnp();

@@ -2,6 +2,7 @@
 // netlink) and the kernel's routing decision for a destination.
 // Promises: outputs untouched on failure; nothing is sent on the network.
 #include "tavo/net.h"
+#include "ground/Fail.h"
 
 #include <arpa/inet.h>
 #include <net/if.h>
@@ -21,15 +22,10 @@
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/net/Net.cpp";
 constexpr uint16_t kAnyPort = 9;  // a destination port is needed, though nothing is sent
 
 using tavo::AtBorder;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
+using tavo::Fail;
 
 using tavo::Cache;
 using tavo::Connect;
@@ -135,10 +131,10 @@ bool ForEachAddress(Seen fnSeen) {
 int TAVONetDefaultGatewayGet(char* szGateway, int nSize) {
     return AtBorder(-1, [&] {
         if (szGateway == nullptr || nSize < 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::optional<in_addr> gateway = DefaultGateway();
-        return gateway && CopyAddress(*gateway, szGateway, nSize) ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        return gateway && CopyAddress(*gateway, szGateway, nSize) ? 0 : Fail(TLIBC_ERR_NOT_FOUND);
     });
 }
 
@@ -153,11 +149,11 @@ int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* s
     return AtBorder(-1, [&] {
         in_addr peer = {};
         if (szPeer == nullptr || szLocal == nullptr || nSize < 1 || inet_pton(AF_INET, szPeer, &peer) != 1) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const std::optional<in_addr> source = SourceTowards(peer);
         if (!source) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         int nInterface = 0;
         ForEachAddress([&](const InterfaceAddress& seen) {
@@ -168,10 +164,10 @@ int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* s
         char szName[IF_NAMESIZE] = {};
         if (szInterface != nullptr && (if_indextoname(static_cast<unsigned>(nInterface), szName) == nullptr ||
                                        std::strlen(szName) >= static_cast<size_t>(nInterfaceSize))) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         if (!CopyAddress(*source, szLocal, nSize)) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         if (szInterface != nullptr) {
             std::snprintf(szInterface, static_cast<size_t>(nInterfaceSize), "%s", szName);
@@ -186,7 +182,7 @@ int TAVONetIsSameSubnet(const char* szOne, const char* szOther, const char* szMa
     in_addr mask = {};
     if (szOne == nullptr || szOther == nullptr || szMask == nullptr || inet_pton(AF_INET, szOne, &one) != 1 ||
         inet_pton(AF_INET, szOther, &other) != 1 || inet_pton(AF_INET, szMask, &mask) != 1) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER);
     }
     return (one.s_addr & mask.s_addr) == (other.s_addr & mask.s_addr) ? 1 : 0;
 }

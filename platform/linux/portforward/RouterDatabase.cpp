@@ -13,6 +13,7 @@
 #include "ground/Border.h"
 #include "ground/ConfList.h"
 #include "ground/Directory.h"
+#include "ground/Fail.h"
 #include "ground/Rename.h"
 #include "ground/RouterScript.h"
 #include "ground/SysLog.h"
@@ -22,21 +23,16 @@ namespace fs = std::filesystem;
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/portforward/RouterDatabase.cpp";
 constexpr char kGeneric[] = "generic";
 constexpr int kVersionSize = 1024;
 
 using tavo::AtBorder;
 using tavo::Directories;
+using tavo::Fail;
 using tavo::IsPathPart;
 using tavo::kDatabase;
 using tavo::kOwnDatabase;
 using tavo::Value;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 bool IsDirectory(const fs::path& path) {
     std::error_code error;
@@ -172,12 +168,12 @@ void LinkOwnDescriptions(const fs::path& database) {
 int RouterDBList(TLIBCSzList** ppList) {
     return AtBorder(-1, [&] {
         if (ppList == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         tavo::BringBackDatabase();
         tavo::LinkOwnDescriptions(kDatabase);
         if (!IsDirectory(kDatabase) && !IsDirectory(kOwnDatabase)) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         std::vector<std::string> rgszNames;
         for (const char* szPlace : {kDatabase, kOwnDatabase}) {
@@ -204,12 +200,12 @@ int RouterDBList(TLIBCSzList** ppList) {
 int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF** ppDesc, TAVO_ROUTER_SCRIPT** ppOps) {
     return AtBorder(-1, [&] {
         if (pSection == nullptr || pSection->pHash == nullptr || ppDesc == nullptr || ppOps == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         tavo::BringBackDatabase();
         const fs::path dir = DescriptionDir(pSection);
         if (dir.empty()) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND);
         }
         tavo::ConfList pDesc = tavo::LoadConfList((dir / "router.des").c_str());
         auto pOps = std::make_unique<TAVO_ROUTER_SCRIPT>();
@@ -217,7 +213,7 @@ int TAVOPFRouterDBLoadDescAndOpsByIp(const TAVO_PF_CONF* pSection, TAVO_PF_CONF*
             pOps->pOperations = tavo::LoadConfList((dir / "router.ops").c_str());
         }
         if (!pDesc) {
-            return Fail(TLIBC_ERR_FORMAT, __LINE__);
+            return Fail(TLIBC_ERR_FORMAT);
         }
         *ppDesc = pDesc.release();
         *ppOps = pOps.release();

@@ -18,6 +18,7 @@
 #include "ground/ConfList.h"
 #include "ground/Descriptor.h"
 #include "ground/Directory.h"
+#include "ground/Fail.h"
 #include "ground/Rename.h"
 #include "ground/RouterScript.h"
 #include "ground/SysLog.h"
@@ -28,7 +29,6 @@ namespace fs = std::filesystem;
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/portforward/RouterRefresh.cpp";
 constexpr char kArchive[] = "routerdb.tgz";
 constexpr int kLocationSize = 1024;
 constexpr int kVersionSize = 1024;
@@ -36,13 +36,9 @@ constexpr size_t kMaxReason = 400;
 constexpr time_t kLongestRefreshSeconds = 600;  // the limits of the commands below, and some more
 
 using tavo::AtBorder;
+using tavo::Fail;
 using tavo::kDatabase;
 using tavo::kDatabaseAside;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 char (&Reason())[kMaxReason + 1] {
     static thread_local char szReason[kMaxReason + 1];
@@ -52,7 +48,7 @@ char (&Reason())[kMaxReason + 1] {
 int Refuse(const std::string& szWhy) {
     std::snprintf(Reason(), kMaxReason + 1, "%s", szWhy.c_str());
     tavo::SysLog(LOG_ERR, "the router descriptions were not refreshed: %s", szWhy.c_str());
-    return Fail(TLIBC_ERR_READ, __LINE__);
+    return Fail(TLIBC_ERR_READ);
 }
 
 // A directory beside the database that goes away with the object; one of a refresh that was killed, with a later one.

@@ -15,13 +15,13 @@
 #include "ground/Border.h"
 #include "ground/ConfList.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/PortText.h"
 #include "ground/SysLog.h"
 #include "portforward/Aside.h"
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/portforward/RuleFile.cpp";
 constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kTestRuleConf[] = "/etc/portforward/testrule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
@@ -32,6 +32,8 @@ constexpr useconds_t kOwnerMicroseconds = 20000;  // who holds a copy is about t
 
 using tavo::AtBorder;
 using tavo::ConfList;
+using tavo::Fail;
+using tavo::SetError;
 using tavo::Value;
 
 // A file of blank lines and comments holds nothing, but whoever goes by its size takes it for a broken one: it
@@ -65,7 +67,7 @@ TAVO_PF_CONF* Load(const char* szPath) {
             tavo::DropObsolete(szPath);
             if (!pList) {
                 EmptyOut(szPath);
-                TLIBCErrSet(TLIBC_ERR_NONE, kFile, __LINE__);
+                SetError(TLIBC_ERR_NONE);
             }
         }
         return pList.release();
@@ -92,8 +94,7 @@ bool FitsRecords(const char* szPath, const TAVO_PF_CONF* pRule) {
                          "%s: the list of ports of rule %s is longer than %d bytes and would be cut: nothing "
                          "is read, write it as two rules",
                          szPath, tavo::PrintableText(pRule->szSection, kMostName).c_str(), TAVO_PF_PORTS_SIZE - 1);
-            TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
-            return false;
+            return Fail(TLIBC_ERR_FORMAT, false);
         }
     }
     return true;
@@ -172,8 +173,7 @@ int CountJobs(const TAVO_PF_CONF* pConf, bool blRange, bool blBothAtOnce) {
     const auto rgRanges = tavo::ParsePortRanges(Value(pConf, "r_port"));
     const auto protocols = tavo::ParseProtocol(Value(pConf, "protocol name"));
     if (!rgRanges || !protocols) {
-        TLIBCErrSet(TLIBC_ERR_FORMAT, kFile, __LINE__);
-        return -1;
+        return Fail(TLIBC_ERR_FORMAT);
     }
     int nItems = 0;
     for (const tavo::PortRange& range : *rgRanges) {
@@ -212,13 +212,11 @@ TAVO_PF_CONF* TAVOPFTestRuleGetByIdList(const char* szIdList) {
 int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
     return AtBorder(-1, [&] {
         if (szPath == nullptr || *szPath == '\0') {
-            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const auto rgSections = Sections(pHead);
         if (rgSections.size() > TAVO_PF_MAX_SECTIONS) {
-            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         return tavo::WriteFileAtomic(szPath, tavo::FormatSections(rgSections)) ? 0 : -1;
     });
@@ -249,8 +247,7 @@ int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, co
     return AtBorder(-1, [&] {
         const bool blRange = szJob != nullptr && std::strcmp(szJob, "PF add range") == 0;
         if (szGwRouterIP == nullptr || szJob == nullptr || (!blRange && std::strcmp(szJob, "PF add port") != 0)) {
-            TLIBCErrSet(TLIBC_ERR_BAD_PARAMETER, kFile, __LINE__);
-            return -1;
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         const bool blBothAtOnce = TakesBothAtOnce(szGwRouterIP);
         int nJobs = 0;

@@ -11,6 +11,7 @@
 #include "ground/Border.h"
 #include "ground/ConfList.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/SysLog.h"
 #include "porttest/PortTest.h"
 #include "porttest/RuleVerdict.h"
@@ -18,18 +19,14 @@
 
 namespace {
 
+using tavo::Fail;
+
 using namespace tavo;
 
-constexpr char kFile[] = "platform/linux/porttest/Tester.cpp";
 constexpr char kMarker[] = "/tmp/pfStatusRule";
 constexpr mode_t kMarkerMode = 0644;
 constexpr int kTestFlag = 1;
 constexpr size_t kMaxQuestions = 4096;  // for all rules together; no settings allow as many
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 // In a directory where everybody may write: a link, or what another user put there, is not the marker.
 bool IsOurMarker() {
@@ -92,14 +89,14 @@ int TavoPortConnTestInit() {
         if (IsOurMarker() || MakeMarker() || (unlink(kMarker) == 0 && MakeMarker())) {
             return 0;
         }
-        return Fail(TLIBC_ERR_WRITE, __LINE__);
+        return Fail(TLIBC_ERR_WRITE);
     });
 }
 
 int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* rgStatus, int nRules) {
     return AtBorder(-1, [&] {
         if (nFlags != kTestFlag || nRules < 0 || (rgStatus == nullptr && nRules > 0)) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         std::vector<PortQuestion> rgQuestions;
         std::vector<RulePart> rgParts;

@@ -3,6 +3,7 @@
 // Promises: a record changes whole or not at all; what nobody here can have written (another type, too
 // deep, too long) is no record; no name leads out of the directory; nothing is thrown.
 #include "tavo/task.h"
+#include "ground/Fail.h"
 
 #include <json/json.h>
 
@@ -16,7 +17,6 @@
 
 namespace {
 
-constexpr char kFile[] = "platform/linux/task/Task.cpp";
 constexpr char kTaskDirectory[] = "/var/lib/tavo/tasks";
 constexpr char kSuffix[] = ".json";
 constexpr mode_t kRecordMode = 0644;  // other processes, of whatever user, read the records
@@ -25,13 +25,9 @@ constexpr size_t kMaxRecord = 1U << 20U;
 constexpr int kMaxDepth = 2;  // an object of texts
 
 using tavo::AtBorder;
+using tavo::Fail;
 using tavo::kStateDir;
 using Properties = std::map<std::string, std::string>;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return 0;
-}
 
 std::string Text(const char* szText) {
     return szText == nullptr ? "" : szText;
@@ -108,7 +104,7 @@ struct Task::Impl {
     int Write() const {
         const std::string szText = FormatRecord(properties);
         if (szPath.empty() || szText.size() > kMaxRecord) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER, 0);
         }
         for (const std::string& szDirectory :
              {std::string(kStateDir), std::string(kTaskDirectory), OwnerDirectory(szOwner)}) {
@@ -131,7 +127,7 @@ int Task::reload() {
     return AtBorder(0, [&] {
         std::optional<Properties> read = mPImpl->szPath.empty() ? std::nullopt : ReadRecord(mPImpl->szPath);
         if (!read) {
-            return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+            return Fail(TLIBC_ERR_NOT_FOUND, 0);
         }
         mPImpl->properties = std::move(*read);
         return 1;
@@ -147,7 +143,7 @@ int Task::remove() {
 
 int Task::beginUpdate() {
     if (mPImpl == nullptr || mPImpl->blUpdating) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER, 0);
     }
     mPImpl->blUpdating = true;
     return 1;
@@ -156,7 +152,7 @@ int Task::beginUpdate() {
 int Task::setProperty(const char* szName, const char* szValue) {
     return AtBorder(0, [&] {
         if (mPImpl == nullptr || Text(szName).empty() || szValue == nullptr) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER, 0);
         }
         mPImpl->properties[szName] = szValue;
         return 1;
@@ -165,7 +161,7 @@ int Task::setProperty(const char* szName, const char* szValue) {
 
 int Task::endUpdate() {
     if (mPImpl == nullptr || !mPImpl->blUpdating) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER, 0);
     }
     mPImpl->blUpdating = false;
     return AtBorder(0, [&] { return mPImpl->Write(); });

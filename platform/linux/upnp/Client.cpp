@@ -11,14 +11,16 @@
 #include <set>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "tavo/upnp.h"
 #include "wire/upnp/GatewayMemory.h"
 
 namespace {
 
+using tavo::Fail;
+
 using Clock = std::chrono::steady_clock;
 
-constexpr char kFile[] = "platform/linux/upnp/Client.cpp";
 constexpr int kFound = 0;
 constexpr int kNotFound = 1;
 constexpr int kMostLimitSeconds = 3600;
@@ -37,11 +39,6 @@ struct Client {
 };
 
 std::unique_ptr<Client> gPClient;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 // The client of this process; null when it has none.
 Client* Own() {
@@ -88,7 +85,7 @@ void Fill(char (&szField)[N], const std::string& szText) {
 // The router's answer as the caller gets it: its own code, or -1 when there was none.
 int Answer(int nCode, const tavo::IgdEntry& mapping, TAVO_UPNP_PORT_MAPPING* pMapping) {
     if (nCode != tavo::kWireOk) {
-        return nCode < 0 ? Fail(TLIBC_ERR_READ, __LINE__) : nCode;
+        return nCode < 0 ? Fail(TLIBC_ERR_READ) : nCode;
     }
     *pMapping = {};
     pMapping->nExternalPort = mapping.nRouterPort;
@@ -110,8 +107,7 @@ int TAVOUpnpInit(int nLimitSeconds, int nLocalPort) {
         pClient->pIgd = tavo::FindGatewayIgd(std::clamp(nLimitSeconds, 0, kMostLimitSeconds) * 1000,
                                              std::clamp(nLocalPort, 0, kMostPort));
         if (pClient->pIgd == nullptr) {
-            TLIBCErrSet(TLIBC_ERR_NOT_FOUND, kFile, __LINE__);
-            return kNotFound;
+            return Fail(TLIBC_ERR_NOT_FOUND, kNotFound);
         }
         gPClient = std::move(pClient);
         return kFound;
@@ -126,7 +122,7 @@ int TAVOUpnpCleanup() {
 int TAVOUpnpGatewayModelGet(TAVO_UPNP_GATEWAY_MODEL* pModel) {
     const Client* pClient = Own();
     if (pClient == nullptr || pModel == nullptr) {
-        return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+        return Fail(TLIBC_ERR_BAD_PARAMETER);
     }
     const tavo::IgdModel& model = pClient->pIgd->Service().model;
     *pModel = {};
@@ -140,7 +136,7 @@ int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
     return tavo::AtBorder(-1, [&] {
         Client* pClient = Own();
         if (pClient == nullptr || pMapping == nullptr || nIndex < 0) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         tavo::IgdEntry mapping;
         const int nCode = ReadEntry(*pClient, nIndex, mapping);
@@ -154,7 +150,7 @@ int TAVOUpnpPortMappingFind(int nExternalPort, const char* szProtocol, TAVO_UPNP
         const std::string szWanted = szProtocol == nullptr ? "" : szProtocol;
         if (pClient == nullptr || pMapping == nullptr || nExternalPort < 0 || nExternalPort > kMostPort ||
             (szWanted != "TCP" && szWanted != "UDP")) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         tavo::IgdEntry mapping;
         const int nCode = FindEntry(*pClient, szWanted, static_cast<uint16_t>(nExternalPort), mapping);

@@ -10,6 +10,7 @@
 #include <memory>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "ground/Marks.h"
 #include "ground/TextFile.h"
 #include "porttest/PortTest.h"
@@ -23,9 +24,9 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 using tavo::AtBorder;
+using tavo::Fail;
 using tavo::TestRule;
 
-constexpr char kFile[] = "platform/linux/upnp/Test.cpp";
 constexpr char kTestProgram[] = "/usr/tavo/sbin/upnpd";
 constexpr int kMostRules = 1000;  // no router for a home keeps more
 constexpr int kFindMilliseconds = 8000;
@@ -35,11 +36,6 @@ constexpr int kMostLimitSeconds = 600;
 constexpr mode_t kMarkerMode = 0644;
 
 int gNLimitSeconds = 60;
-
-int Fail(int nErr, int nLine) {
-    TLIBCErrSet(nErr, kFile, nLine);
-    return -1;
-}
 
 void Log(const std::string& szText) {
     TAVOWriteLog(szText.c_str(), 1, 1);
@@ -98,7 +94,7 @@ int CountHeld() {
     for (const TestRule& rule : rgKept) {
         bool blShown = false;
         if (!table.Shows(rule, blShown)) {
-            return Fail(TLIBC_ERR_READ, __LINE__);
+            return Fail(TLIBC_ERR_READ);
         }
         nHeld += blShown ? 1 : 0;
     }
@@ -171,7 +167,7 @@ int TestPorts(bool blAdded) {
     const std::vector<TestRule> rgKept = KeptRules();
     const int nMarked = TavoPortConnTestInit();  // first, for the report of a failure
     if (rgKept.empty() || !tavo::IsTestDaemonAlive()) {
-        return Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        return Fail(TLIBC_ERR_NOT_FOUND);
     }
     if (nMarked < 0) {
         return -1;
@@ -179,7 +175,7 @@ int TestPorts(bool blAdded) {
     const std::vector<int> rgVerdicts = AskOutside(rgKept);
     const bool blGood = rgVerdicts.empty() ? JudgeByTable(rgKept, blAdded) : JudgeOutside(rgVerdicts, blAdded);
     WriteMarker(rgKept, blAdded, blGood);
-    return blGood ? 0 : Fail(TLIBC_ERR_READ, __LINE__);
+    return blGood ? 0 : Fail(TLIBC_ERR_READ);
 }
 
 // An answer that makes the caller give up ends the daemon.
@@ -214,7 +210,7 @@ int TAVOUPnPAddTest(int nRules) {
         TLIBCFileTouch(tavo::kUpnpResults);
         TavoPortConnTestInit();
         if (nRules < 1 || tavo::IsTestDaemonAlive()) {
-            return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+            return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
         if (!tavo::SaveTestRules(NewRules(nRules))) {
             return -1;
@@ -230,8 +226,7 @@ int TAVOUPnPCountMaxRule() {
 int TAVOUPnPDeletetest() {
     return AtBorder(-1, [] {
         const bool blEnd = tavo::IsStepUnderWay(tavo::kStepTerminal);
-        return tavo::SendTestOrder(blEnd ? tavo::kOrderEnd : tavo::kOrderDelete) ? 0
-                                                                                 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__);
+        return tavo::SendTestOrder(blEnd ? tavo::kOrderEnd : tavo::kOrderDelete) ? 0 : Fail(TLIBC_ERR_NOT_FOUND);
     });
 }
 
@@ -240,7 +235,7 @@ int TAVOUPnPSetupTest(int nLimitSeconds, int nFlags) {
         [&] {
             const int nMarked = TavoPortConnTestInit();  // first, as above
             if (nLimitSeconds < 1 || nFlags != 0 || !tavo::IsTestDaemonAlive()) {
-                return Fail(TLIBC_ERR_BAD_PARAMETER, __LINE__);
+                return Fail(TLIBC_ERR_BAD_PARAMETER);
             }
             gNLimitSeconds = std::min(nLimitSeconds, kMostLimitSeconds);
             return nMarked < 0 ? -1 : 0;
@@ -253,12 +248,11 @@ int TAVOUPnPPortTest(int blAdded) {
 }
 
 int TAVOUPnPModifyRule() {
-    return AtBorder(-1,
-                    [] { return tavo::SendTestOrder(tavo::kOrderModify) ? 0 : Fail(TLIBC_ERR_NOT_FOUND, __LINE__); });
+    return AtBorder(-1, [] { return tavo::SendTestOrder(tavo::kOrderModify) ? 0 : Fail(TLIBC_ERR_NOT_FOUND); });
 }
 
 int TAVOUpnpRemoveTestRulePath() {
-    return tavo::RemoveTestRules() ? 0 : Fail(TLIBC_ERR_WRITE, __LINE__);
+    return tavo::RemoveTestRules() ? 0 : Fail(TLIBC_ERR_WRITE);
 }
 
 int TAVOUpnpReportTestProgress(const char* szStep, const char* szValue, int /*nFlags*/) {
