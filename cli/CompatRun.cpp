@@ -72,9 +72,9 @@ TestRun RunTest(int nRules, bool blJson) {
 
 Reply NotRun(const TestRun& run) {
     switch (run.result.nStatus) {
-        case 2:
+        case TAVO_ROUTER_STATUS_LOCKED:
             return Busy();
-        case 13:
+        case TAVO_ROUTER_STATUS_NO_GATEWAY:
             return Failure(
                 "no router answered that speaks UPnP and says what it is; nothing was changed. 'tavoportmap setup' "
                 "looks "

@@ -86,7 +86,7 @@ Reply WhyFailed(const StoredRouter& router, const Rules& rules, const SaveResult
 // Which ports the router refused, and what became of the others.
 std::string WhyRefused(const SaveResult& result, Way enWay) {
     const std::string szPorts = Clean(result.szPortList);
-    if (result.nStatus == 9) {
+    if (result.nStatus == TAVO_ROUTER_STATUS_ADD_FAILED) {
         return fmt::format(
             "these ports are not open on the router: {}\nThe others, if any, are. The reasons stand in "
             "/var/tmp/upnp_portmap.status",
@@ -109,13 +109,13 @@ std::string WhyTooMany(const SaveResult& result, size_t nRules) {
     const std::string szHint =
         "\nNothing was changed; 'tavoportmap rules list' shows the rules: remove some, or 'rules discard' the edits";
     switch (result.nStatus) {
-        case 7:
+        case TAVO_ROUTER_STATUS_TOO_MANY_RULES:
             return fmt::format("the router holds {} and there are {}", Count(result.nLimit, "rule"), nRules) + szHint;
-        case 11:
+        case TAVO_ROUTER_STATUS_NO_RANGE_PAGE:
             return fmt::format("the router holds {}, each of them one port or one range",
                                Count(result.nLimit, "place")) +
                    szHint;
-        case 12:
+        case TAVO_ROUTER_STATUS_RANGE_LIMIT:
             return fmt::format("the router holds {} and {}", Count(result.nLimit, "single port"),
                                Count(result.nLimit2, "range")) +
                    szHint;
@@ -130,21 +130,21 @@ std::string WhyTooMany(const SaveResult& result, size_t nRules) {
 // The library's own word on a save that did not come to its end.
 Reply Explain(const SaveResult& result, const StoredRouter& router, size_t nRules) {
     switch (result.nStatus) {
-        case 2:
+        case TAVO_ROUTER_STATUS_LOCKED:
             return Busy();
-        case 7:
-        case 10:
-        case 11:
-        case 12: {
+        case TAVO_ROUTER_STATUS_TOO_MANY_RULES:
+        case TAVO_ROUTER_STATUS_PORT_LIMIT:
+        case TAVO_ROUTER_STATUS_NO_RANGE_PAGE:
+        case TAVO_ROUTER_STATUS_RANGE_LIMIT: {
             Reply reply{.enExit = kTooMany, .szMessage = WhyTooMany(result, nRules)};
             reply.jsAnswer["limit"] = result.nLimit;
-            if (result.nStatus == 12) {
+            if (result.nStatus == TAVO_ROUTER_STATUS_RANGE_LIMIT) {
                 reply.jsAnswer["range_limit"] = result.nLimit2;
             }
             return reply;
         }
-        case 8:
-        case 9: {
+        case TAVO_ROUTER_STATUS_PORT_CONFLICT:
+        case TAVO_ROUTER_STATUS_ADD_FAILED: {
             Reply reply{.enExit = kRefused, .szMessage = WhyRefused(result, router.enWay)};
             for (const std::string& szPort : CLI::detail::split(result.szPortList, ',')) {
                 reply.jsAnswer["ports"].append(CLI::detail::trim_copy(szPort));
@@ -251,7 +251,7 @@ Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, cons
     if (nResult == 0) {
         keys.Keep();
     }
-    if (nResult != 0 && result.nStatus == 0) {
+    if (nResult != 0 && result.nStatus == TAVO_ROUTER_STATUS_NONE) {
         return WhyFailed(router, rules, result);
     }
     const auto published = PublishedSince(router, rules, nStart);

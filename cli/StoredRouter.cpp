@@ -7,8 +7,6 @@ namespace tavo::cli {
 
 namespace {
 
-enum SaveStatus : int { kTooManyRules = 7, kTooManyPorts = 10, kNoRangePage = 11, kTooManyRanges = 12 };
-
 constexpr char kFindOut[] =
     "\n  tavoportmap setup                          asks the router, tests it and remembers the answer"
     "\n  tavoportmap router set --brand BRAND --model MODEL --upnp yes"
@@ -20,13 +18,13 @@ void ReportPages(RouterDB& db, int nMaxPort, int nMaxRange, SaveResult& result) 
     db.IsSupportPageRange(blRangePage);
     result.nLimit = nMaxPort;
     if (nMaxRange != 0 && nMaxPort > 0 && nMaxRange > 0) {
-        result.nStatus = kTooManyRanges;
+        result.nStatus = TAVO_ROUTER_STATUS_RANGE_LIMIT;
         result.nLimit2 = nMaxRange;
     } else if (nMaxRange != 0) {
-        result.nStatus = kTooManyPorts;
+        result.nStatus = TAVO_ROUTER_STATUS_PORT_LIMIT;
         result.nLimit = -1;
     } else {
-        result.nStatus = blRangePage ? kNoRangePage : kTooManyPorts;
+        result.nStatus = blRangePage ? TAVO_ROUTER_STATUS_NO_RANGE_PAGE : TAVO_ROUTER_STATUS_PORT_LIMIT;
     }
 }
 
@@ -101,7 +99,7 @@ bool Fits(const StoredRouter& router, const std::string& szGateway, const Rules&
     if (!blKnown || nMaxRules < 1 || rules.size() <= static_cast<size_t>(nMaxRules)) {
         return true;
     }
-    result.nStatus = kTooManyRules;
+    result.nStatus = TAVO_ROUTER_STATUS_TOO_MANY_RULES;
     result.nLimit = nMaxRules;
     return false;
 }

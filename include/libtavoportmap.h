@@ -83,6 +83,26 @@ typedef enum __TAG_TAVO_ROUTER_INIT_STATE TAVO_ENUM_INT {
     TAVO_ROUTER_INIT_STATE_MANUAL = 3
 } __TAG_TAVO_ROUTER_INIT_STATE;
 
+/* What stood in the way of a save (2 to 12) or of a compatibility test (2, 13 to 20); nStatus of their records. */
+typedef enum TAVO_ROUTER_STATUS TAVO_ENUM_INT {
+    TAVO_ROUTER_STATUS_NONE = 0, /* nothing that has a number; look at the return value and the log */
+    TAVO_ROUTER_STATUS_LOCKED = 2,
+    TAVO_ROUTER_STATUS_TOO_MANY_RULES = 7, /* more than the router holds */
+    TAVO_ROUTER_STATUS_PORT_CONFLICT = 8,
+    TAVO_ROUTER_STATUS_ADD_FAILED = 9,
+    TAVO_ROUTER_STATUS_PORT_LIMIT = 10,    /* 10 to 12: more than the router's pages hold; single ports, */
+    TAVO_ROUTER_STATUS_NO_RANGE_PAGE = 11, /* places, each for one port or one range, */
+    TAVO_ROUTER_STATUS_RANGE_LIMIT = 12,   /* single ports and ranges */
+    TAVO_ROUTER_STATUS_NO_GATEWAY = 13,    /* none that speaks UPnP */
+    TAVO_ROUTER_STATUS_TEST_ADD = 14,      /* 14 to 20: the failed step, only for a router without a name */
+    TAVO_ROUTER_STATUS_TEST_MAX = 15,
+    TAVO_ROUTER_STATUS_TEST_DELETE = 16,
+    TAVO_ROUTER_STATUS_TEST_OPEN_PORTS = 17,
+    TAVO_ROUTER_STATUS_TEST_CLOSED_PORTS = 18,
+    TAVO_ROUTER_STATUS_TEST_READD = 19,
+    TAVO_ROUTER_STATUS_TEST_TERMINAL = 20
+} TAVO_ROUTER_STATUS;
+
 TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SUPPORT) == 4, "four bytes");
 TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_TASK) == 4, "four bytes");
 TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_ERR) == 4, "four bytes");
@@ -167,7 +187,7 @@ TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, pNext) % sizeof(void*) == 0, "lis
 #endif
 typedef struct __tag_TAVO_ROUTER_SAVE_RULE_RESULT {
     int nProgress; /* percent: 20, 40, 60, 80, 90, 100 */
-    int nStatus;   /* 2 locked, 7 too many rules, 8 port conflict, 9 add failed, 10 to 12 manual router's limits */
+    int nStatus;   /* TAVO_ROUTER_STATUS */
     union {
         char szPortList[TAVO_TEXT_SIZE]; /* 8 and 9: the refused mappings */
         __extension__ struct {
@@ -187,7 +207,7 @@ TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SAVE_RULE_RESULT) == 8 + 1024, "save layout
 /* Progress and outcome of the UPnP compatibility test. */
 typedef struct __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT {
     int nProgress; /* percent: 10, 20, 30, 60, 40, 50, 70, 80, 90, 100 */
-    int nStatus;   /* 2 locked, 13 no UPnP gateway; 14 to 20, the failed step, only for a router without a name */
+    int nStatus;   /* TAVO_ROUTER_STATUS */
     char szBrand[TAVO_TEXT_SIZE];
     char szModel[TAVO_TEXT_SIZE];
     char szVersion[TAVO_TEXT_SIZE];

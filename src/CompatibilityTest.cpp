@@ -66,18 +66,6 @@ constexpr int kStepValueSize = 1024;
 constexpr size_t kRouterLogLineSize = 512;
 constexpr size_t kCountTextSize = 8;
 
-enum TestStatus : int {
-    kTestLocked = 2,
-    kTestNoGateway = 13,
-    kTestAdd = 14,
-    kTestMax = 15,
-    kTestDelete = 16,
-    kTestOpenPorts = 17,
-    kTestClosedPorts = 18,
-    kTestReadd = 19,
-    kTestTerminal = 20
-};
-
 // One line of the router log; szFormat takes the file and the line.
 void RouterLog(const char* szFormat, int nLine) {
     char szText[kRouterLogLineSize] = {};
@@ -178,7 +166,7 @@ int FillTestResult(TestResult* pResult, const TAVO_UPNP_GATEWAY_MODEL& model, co
         LogError("%s:%d testCompResult is NULL", kEntryFile, __LINE__);
         return -1;
     }
-    pResult->nStatus = 0;
+    pResult->nStatus = TAVO_ROUTER_STATUS_NONE;
     pResult->nProgress = 100;
     FillText(pResult->szBrand, model.szBrand);
     FillText(pResult->szModel, model.szModel);
@@ -233,7 +221,7 @@ bool CompatibilityTest::Fail(int nStatus) {
 
 bool CompatibilityTest::NoGateway() {
     LogError("%s:%d TavoUpnpTestInit() failed", kEntryFile, __LINE__);
-    return Fail(kTestNoGateway);
+    return Fail(TAVO_ROUTER_STATUS_NO_GATEWAY);
 }
 
 bool CompatibilityTest::FindGateway() {
@@ -266,9 +254,9 @@ bool CompatibilityTest::AddRules() {
     if (TAVOUPnPAddTest(mNRules) < 0) {
         Report(kStepAdd, kFailed);
         LogError("%s:%d TavoUpnpTestAdd() failed", kEntryFile, __LINE__);
-        return Fail(kTestAdd);
+        return Fail(TAVO_ROUTER_STATUS_TEST_ADD);
     }
-    return IsStepDone(kStepAdd) || Fail(kTestAdd);
+    return IsStepDone(kStepAdd) || Fail(TAVO_ROUTER_STATUS_TEST_ADD);
 }
 
 bool CompatibilityTest::CountRules() {
@@ -279,11 +267,11 @@ bool CompatibilityTest::CountRules() {
     if (nCount < 1) {
         Report(kStepMax, "-1");
         LogError("%s:%d TavoUpnpTestMaxRuleGet() failed", kEntryFile, __LINE__);
-        return Fail(kTestMax);
+        return Fail(TAVO_ROUTER_STATUS_TEST_MAX);
     }
     char szCount[kCountTextSize] = {};
     if (std::snprintf(szCount, sizeof(szCount), "%d", nCount) < 0) {
-        return Fail(kTestMax);
+        return Fail(TAVO_ROUTER_STATUS_TEST_MAX);
     }
     Report(kStepMax, szCount);
     char szValue[kStepValueSize] = {};
@@ -302,9 +290,9 @@ bool CompatibilityTest::DeleteRules() {
     if (TAVOUPnPDeletetest() < 0) {
         Report(kStepDelete, kFailed);
         LogError("%s:%d TavoUpnpTestDeleteRules() failed", kEntryFile, __LINE__);
-        return Fail(kTestDelete);
+        return Fail(TAVO_ROUTER_STATUS_TEST_DELETE);
     }
-    return IsStepDone(kStepDelete) || Fail(kTestDelete);
+    return IsStepDone(kStepDelete) || Fail(TAVO_ROUTER_STATUS_TEST_DELETE);
 }
 
 bool CompatibilityTest::ClosedPorts() {
@@ -315,10 +303,10 @@ bool CompatibilityTest::ClosedPorts() {
     if (TAVOUPnPSetupTest(kConnectionLimitSeconds, 0) != 0 || TAVOUPnPPortTest(0) != 0) {
         Report(kStepClosed, kFailed);
         LogError("%s:%d TavoUpnpTestConnForDeletedPorts() failed", kEntryFile, __LINE__);
-        return Fail(kTestClosedPorts);
+        return Fail(TAVO_ROUTER_STATUS_TEST_CLOSED_PORTS);
     }
     Report(kStepClosed, kSuccess);
-    return IsStepDone(kStepClosed) || Fail(kTestClosedPorts);
+    return IsStepDone(kStepClosed) || Fail(TAVO_ROUTER_STATUS_TEST_CLOSED_PORTS);
 }
 
 bool CompatibilityTest::ReaddRules() {
@@ -329,9 +317,9 @@ bool CompatibilityTest::ReaddRules() {
         Report(kStepReadd1, kFailed);
         Report(kStepReadd2, kFailed);
         LogError("%s:%d TavoUpnpTestReAdd() failed", kEntryFile, __LINE__);
-        return Fail(kTestReadd);
+        return Fail(TAVO_ROUTER_STATUS_TEST_READD);
     }
-    return (IsStepDone(kStepReadd1) && IsStepDone(kStepReadd2)) || Fail(kTestReadd);
+    return (IsStepDone(kStepReadd1) && IsStepDone(kStepReadd2)) || Fail(TAVO_ROUTER_STATUS_TEST_READD);
 }
 
 bool CompatibilityTest::OpenPorts() {
@@ -342,19 +330,19 @@ bool CompatibilityTest::OpenPorts() {
     if (TAVOUPnPPortTest(1) != 0) {
         Report(kStepOpen, kFailed);
         LogError("%s:%d TavoUpnpTestConnForAddedPorts() failed", kEntryFile, __LINE__);
-        return Fail(kTestOpenPorts);
+        return Fail(TAVO_ROUTER_STATUS_TEST_OPEN_PORTS);
     }
     Report(kStepOpen, kSuccess);
-    return IsStepDone(kStepOpen) || Fail(kTestOpenPorts);
+    return IsStepDone(kStepOpen) || Fail(TAVO_ROUTER_STATUS_TEST_OPEN_PORTS);
 }
 
 bool CompatibilityTest::EndTest() {
     Progress(90);
     if (EndTestDaemon() < 0) {
         LogError("%s:%d TavoUpnpTestTerminate() failed", kEntryFile, __LINE__);
-        return Fail(kTestTerminal);
+        return Fail(TAVO_ROUTER_STATUS_TEST_TERMINAL);
     }
-    return IsStepDone(kStepTerminal) || Fail(kTestTerminal);
+    return IsStepDone(kStepTerminal) || Fail(TAVO_ROUTER_STATUS_TEST_TERMINAL);
 }
 
 bool CompatibilityTest::RunSteps() {
@@ -376,7 +364,7 @@ int CompatibilityTest::Run(bool blLock) {
     RouterLock lock;
     if (blLock && !lock.Get()) {
         LogError("%s:%d PortForward conflict = %s", kEntryFile, __LINE__, kRouterLock);
-        Fail(kTestLocked);
+        Fail(TAVO_ROUTER_STATUS_LOCKED);
         return EndEarly();
     }
     RemoveFile(kTestStepFile);

@@ -35,16 +35,6 @@ using tavo::lib::SetRunKey;
 using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
 using SaveCallback = void (*)(const SaveResult*, void*);
 
-enum SaveStatus : int {
-    kStatusLocked = 2,
-    kStatusTooManyRules = 7,
-    kStatusConflict = 8,
-    kStatusAddFailed = 9,
-    kStatusPortLimit = 10,
-    kStatusNoRangePage = 11,
-    kStatusRangeLimit = 12
-};
-
 // What saving through one daemon says differently from saving through the other; the texts take the file
 // and the line.
 struct DaemonWay {
@@ -205,7 +195,7 @@ bool RuleSave::FitsRouter() {
         return Refuse("%s:%d check exceed max rule fail", kEntryFile, __LINE__);
     }
     if (blExceed) {
-        Limits(kStatusTooManyRules, nMaxRule);
+        Limits(TAVO_ROUTER_STATUS_TOO_MANY_RULES, nMaxRule);
         return Refuse("%s:%d exceed max rule", kEntryFile, __LINE__);
     }
     return true;
@@ -262,7 +252,7 @@ bool RuleSave::ReadBack(NatpmpDaemon& daemon) {
     }
     LogError("%s:%d natpmpd checking is done", kEntryFile, __LINE__);
     if (blRemap) {
-        Ports(kStatusConflict, szRemap);
+        Ports(TAVO_ROUTER_STATUS_PORT_CONFLICT, szRemap);
         return Refuse("%s:%d natpmp port conflict", kEntryFile, __LINE__);
     }
     return true;
@@ -278,12 +268,12 @@ bool RuleSave::ReadBack(UpnpDaemon& daemon) {
     }
     LogError("%s:%d upnpd checking is done", kEntryFile, __LINE__);
     if (blConflict) {
-        Ports(kStatusConflict, szConflict);
+        Ports(TAVO_ROUTER_STATUS_PORT_CONFLICT, szConflict);
         TAVOLogSet1(1, 2, TAVO_EVENT_PF_CONFLICT, szConflict.c_str(), "", "", "");
         return Refuse("%s:%d upnp port conflict", kEntryFile, __LINE__);
     }
     if (blError) {
-        Ports(kStatusAddFailed, szError);
+        Ports(TAVO_ROUTER_STATUS_ADD_FAILED, szError);
         TAVOLogSet1(1, 3, TAVO_EVENT_PF_ADD_FAILED, szError.c_str(), "", "", "");
         return Refuse("%s:%d upnp add port fail", kEntryFile, __LINE__);
     }
@@ -299,20 +289,20 @@ void RuleSave::ReportManualExcess(RouterDB& db, int nMaxPort, int nPortJob, int 
         blIsSupport = false;
     }
     if (nMaxRange != 0 && nMaxPort > 0 && nMaxRange > 0) {
-        Limits(kStatusRangeLimit, nMaxPort);
+        Limits(TAVO_ROUTER_STATUS_RANGE_LIMIT, nMaxPort);
         if (mPResult != nullptr) {
             mPResult->nLimit2 = nMaxRange;
         }
         LogError("%s:%d exceed range max port", kEntryFile, __LINE__);
     } else if (nMaxRange != 0) {
-        Limits(kStatusPortLimit, -1);
+        Limits(TAVO_ROUTER_STATUS_PORT_LIMIT, -1);
         LogError("%s:%d exceed max rule, unknown err, nMaxPort=%d nPortJob=%d nMaxRange=%d nRangeJob=%d blIsSupport=%s",
                  kEntryFile, __LINE__, nMaxPort, nPortJob, nMaxRange, nRangeJob, blIsSupport ? "true" : "false");
     } else if (blIsSupport) {
-        Limits(kStatusNoRangePage, nMaxPort);
+        Limits(TAVO_ROUTER_STATUS_NO_RANGE_PAGE, nMaxPort);
         LogError("%s:%d get max range == 0", kEntryFile, __LINE__);
     } else {
-        Limits(kStatusPortLimit, nMaxPort);
+        Limits(TAVO_ROUTER_STATUS_PORT_LIMIT, nMaxPort);
         LogError("%s:%d get bl is support page range == 0", kEntryFile, __LINE__);
     }
 }
@@ -360,7 +350,7 @@ bool RuleSave::Run(bool blLock, RouterLock& lock) {
     Progress(20);
     if (blLock && !lock.Get()) {
         LogError("%s:%d PortForward conflict = %s", kEntryFile, __LINE__, kRouterLock);
-        mPResult->nStatus = kStatusLocked;  // whoever asks for the lock passes a record
+        mPResult->nStatus = TAVO_ROUTER_STATUS_LOCKED;  // whoever asks for the lock passes a record
         return false;
     }
     Progress(40);
