@@ -22,6 +22,7 @@ import unittest
 BUILD = os.environ["TAVO_BUILD_DIR"]
 SOURCE = os.environ["TAVO_SOURCE_DIR"]
 TOOL = f"{BUILD}/cli/tavoportmap"
+NETCHECK = f"{BUILD}/platform/linux/tavo-netcheck"
 STAND_IN = f"{BUILD}/tests/cli/libstand_in.so"
 CONF = "/etc/portforward"
 RULES, ROUTER = f"{CONF}/rule.conf", f"{CONF}/router.conf"
@@ -1103,6 +1104,42 @@ class Tool(unittest.TestCase):
                 run.send_signal(signal.SIGINT)
                 self.assertEqual(run.wait(timeout=10), REFUSED)
             self.publish(pid)
+
+    def test_a_live_watch_asks_the_router_each_half_minute(self):
+        self.publish(self.keep())
+        world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:443@192.168.77.2:8443", "TAVO_HURRY": "1"}
+        with subprocess.Popen([TOOL, "status", "--watch", "--live"], text=True, stdout=subprocess.DEVNULL,
+                              stderr=subprocess.PIPE, env={**os.environ, **world}) as run:
+            lines = (run.stderr.readline() for _ in range(200))
+            next(line for line in lines if line.startswith("asked"))
+            waited = sum(int(line.split()[0]) for line in itertools.takewhile(lambda line: "ms" in line, lines))
+            run.send_signal(signal.SIGINT)
+            self.assertEqual(run.wait(timeout=10), REFUSED)
+        self.assertEqual(waited, 30000)
+
+    def test_netcheck_says_what_each_check_found(self):
+        """The five answers, the number of routers to look at, and the word of each check that then fails."""
+        good = "eth0 0 192.168.77.1 0 0 1 0"
+        for checks, arguments, failing, pattern in (
+                (good, (), (), "3 hops(?s:.)*eth0 is up(?s:.)*192.168.77.1 is the default(?s:.)*a host outside answers"
+                               "(?s:.)*1: only the home router(?s:.)*servers answer"),
+                ("eth0 0 192.168.77.1 0 0 0 0", ("1",), (), "1 hops(?s:.)*0: this box has a public address"),
+                ("eth0 0 192.168.77.1 0 0 2 0", ("30",), ("level",), "30 hops(?s:.)*2: a second router"),
+                ("eth0 0 192.168.77.1 0 0 -1 0", (), ("level",), "neither the gateway nor"),
+                ("eth0 -1 192.168.77.1 0 0 1 0", (), ("interface",), "eth0 is down"),
+                ("- -1 - -1 0 1 0", (), ("interface", "gateway"), "no network interface(?s:.)*no default gateway"),
+                ("eth0 0 192.168.77.1 -1 0 1 0", (), ("gateway",), "192.168.77.1 is in none of the networks"),
+                ("eth0 0 192.168.77.1 0 -1 1 -1", (), ("outside", "names"), "no host outside(?s:.)*servers do not answer")):
+            run = subprocess.run([NETCHECK, *arguments], text=True, capture_output=True, check=False,
+                                 env={**os.environ, "LD_PRELOAD": STAND_IN, "TAVO_CHECKS": checks})
+            self.assertRegex(run.stderr + run.stdout, pattern)
+            self.assertEqual(run.returncode, FAILED if failing else OK, checks)
+            self.assertEqual(re.findall(r"(?m)^(\w+) +(ok|FAIL) +\d\.\d\d s  \w", run.stdout),
+                             [(name, "FAIL" if name in failing else "ok")
+                              for name in ("interface", "gateway", "outside", "level", "names")])
+        for arguments, code in ((("--help",), OK), (("0",), USAGE), (("31",), USAGE), (("x",), USAGE), (("3", "3"), USAGE)):
+            run = subprocess.run([NETCHECK, *arguments], text=True, capture_output=True, check=False)
+            self.assertEqual((run.returncode, (run.stderr if code else run.stdout)[:6]), (code, "Usage:"), arguments)
 
     def test_status_knows_a_detection_by_its_lock(self):
         self.keep(on="none", alive=False)
