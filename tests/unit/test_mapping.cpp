@@ -729,6 +729,20 @@ TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
     }
 }
 
+// What a rule is called on the router, to a user, and as a key; each text with what it is cut at.
+TEST(Rules, TheirTextsAreHarmlessAndOfALengthThatIsKept) {
+    const std::string szLong(300, 'x');
+    for (const auto& [szService, szRouter, szTitle] :
+         {std::tuple<std::string, std::string, std::string>{"web", "web", "web"},
+          {" ~\x7f\x1f", " ~__", " ~"},
+          {szLong, szLong.substr(0, 55), szLong.substr(0, 200)}}) {
+        const tavo::RuleText rule{szService, "tcp", "1=2#" + szLong, ""};
+        EXPECT_EQ(tavo::MappingDescription(rule), tavo::kOwnPrefix + szRouter);
+        EXPECT_EQ(tavo::RuleTitle(rule), szTitle);
+        EXPECT_EQ(tavo::RuleName(rule), "1_2_" + szLong.substr(0, 196));
+    }
+}
+
 TEST(Rules, EachOutcomeHasANameOfItsOwn) {
     std::vector<tavo::RuleText> rgRules;
     for (const char* szBoxPorts : {"1-2", "9", "8", "7", "1-3"}) {

@@ -15,8 +15,10 @@
 #include "ground/PortText.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
+#include "programs/common/RuleFile.h"
 #include "programs/tavohook/Hooks.h"
 #include "tavo/core.h"
+#include "tavo/log.h"
 #include "tavo/net.h"
 #include "tavo/portforward.h"
 #include "world.h"
@@ -24,6 +26,149 @@
 namespace {
 
 constexpr char kPath[] = "/tmp/t/file";
+constexpr char kKeys[] = "/tmp/t/keys";
+
+// What no caller may ask for, answered by -1 or null, with the reason; beside it what he just may.
+TEST(Platform, WhatCannotBeAskedForIsRefusedAndChangesNothing) {
+    const auto fnRefused = [](long nAnswers, long nWanted, int nErr = TLIBC_ERR_BAD_PARAMETER) {
+        EXPECT_EQ(nAnswers, nWanted);
+        EXPECT_EQ(TLIBCErrGet(), nErr);
+        EXPECT_TRUE(TLIBCErrorGetLine() > 0 && *TLIBCErrorGetFile() != '\0');
+        TLIBCErrSet(TLIBC_ERR_NONE, nullptr, 0);
+    };
+    const auto fnNull = [](const void* p) { return p == nullptr ? -1 : 0; };
+    const auto fnSet = [](const char* szKey, const char* szFormat) {
+        return TLIBCFileSetKeyValue(kKeys, szKey, "v", szFormat);
+    };
+    const auto fnValue = [](const char* szPath, const char* szSection, const char* szKey, char* szOut, int nSize) {
+        return TLIBCFileGetSectionValue(szPath, szSection, szKey, szOut, nSize);
+    };
+    constexpr const char* kNo = nullptr;
+    constexpr char kIp[] = "1.1.1.1";
+    const std::string szMost(127, 'n');
+    TLIBCSzHash* pHash = TLIBCSzHashAlloc(0);
+    TLIBCSzList* pList = TLIBCSzListAlloc(0);
+    TLIBCSzHash* pOut = nullptr;
+    const char* szKey = nullptr;
+    const char* szValue = nullptr;
+    char szText[16] = "as it was";
+    TAVO_NET_CARD card = {};
+    ASSERT_EQ(TLIBCSzHashSetValue(pHash, "k", "v") + TLIBCSzListPush(pList, "item"), 2);
+    Write(kPath, "[s]\nk=v\n");
+    Write(kKeys, "k=v\n");
+    fnRefused(TLIBCFileTouch(kNo) + TLIBCFileExist(kNo), -1);
+    fnRefused(TLIBCFileTouch("/nowhere/x"), -1, TLIBC_ERR_OPEN);
+    fnRefused(TLIBCFileGetSection(kNo, "s", pHash) + TLIBCFileGetSection(kPath, kNo, pHash), -2);
+    fnRefused(TLIBCFileGetSection(kPath, "s", nullptr) + TLIBCFileAddSection(kPath, "s", nullptr, 0), -2);
+    fnRefused(TLIBCFileAddSection(kNo, "s", pHash, 0) + TLIBCFileAddSection(kPath, kNo, pHash, 0), -2);
+    fnRefused(fnValue(kNo, "s", "k", szText, 9) + fnValue(kPath, kNo, "k", szText, 9), -2);
+    fnRefused(fnValue(kPath, "s", kNo, szText, 9) + fnValue(kPath, "s", "k", nullptr, 9), -2);
+    fnRefused(fnValue(kPath, "s", "k", szText, 0), -1);
+    fnRefused(fnValue(kPath, "t", "k", szText, 9) + fnValue(kPath, "s", "l", szText, 9), -2, TLIBC_ERR_NOT_FOUND);
+    fnRefused(TLIBCFileGetKeyValue(kNo, "k", szText, 9, 0) + TLIBCFileGetKeyValue(kKeys, kNo, szText, 9, 0), -2);
+    fnRefused(TLIBCFileGetKeyValue(kKeys, "k", nullptr, 9, 0) + TLIBCFileGetKeyValue(kKeys, "k", szText, 0, 0), -2);
+    fnRefused(TLIBCFileGetKeyValue(kKeys, "l", szText, 9, 0), -1, TLIBC_ERR_NOT_FOUND);
+    fnRefused(TLIBCFileSetKeyValue(kNo, "k", "v", kNo) + TLIBCFileSetKeyValue(kKeys, "k", kNo, kNo), -2);
+    fnRefused(fnSet(kNo, kNo) + fnSet("", kNo) + fnSet(" k", kNo) + fnSet("k=l", kNo), -4);
+    fnRefused(fnSet("k", "%s") + fnSet("k", "%s=%s%s") + fnSet("k", "%s=%s\n%"), -3);
+    fnRefused(TLIBCFileGetKeys(kNo, kNo, &pOut, "=") + TLIBCFileGetKeys(kKeys, kNo, nullptr, "="), -2);
+    fnRefused(TLIBCFileGetKeys(kKeys, kNo, &pOut, kNo) + TLIBCFileGetKeys(kKeys, kNo, &pOut, ""), -2);
+    fnRefused(fnNull(TLIBCSzHashAlloc(-1)) + TLIBCSzHashCount(nullptr), -2);
+    fnRefused(TLIBCSzHashSetValue(nullptr, "k", "v") + TLIBCSzHashSetValue(pHash, kNo, "v"), -2);
+    fnRefused(TLIBCSzHashSetValue(pHash, "", "v"), -1);
+    fnRefused(fnNull(TLIBCSzHashGetValue(nullptr, "k")) + fnNull(TLIBCSzHashGetValue(pHash, kNo)), -2);
+    fnRefused(fnNull(TLIBCSzListAlloc(-1)) + TLIBCSzListCount(nullptr), -2);
+    fnRefused(TLIBCSzListPush(nullptr, "x") + TLIBCSzListPush(pList, kNo), -2);
+    fnRefused(TLIBCIsProcAlive(kNo) + TLIBCIsProcAlive("") + TLIBCKill(kNo, 0) + TLIBCKill("", 0), -4);
+    fnRefused(TLIBCKill("x", -1) + TLIBCKill("x", NSIG) + TLIBCReadPidFile(kNo) + TLIBCSystem(kNo), -4);
+    fnRefused(TLIBCExec(kNo, kNo, kNo, kNo, kNo) + TLIBCExec("", kNo, kNo, kNo, kNo), -2);
+    fnRefused(TLIBServiceIsRunning(kNo) + TLIBServiceIsRunning("") + TLIBServiceIsRunning("-x"), -3);
+    fnRefused(TLIBServiceIsRunning(".x") + TLIBServiceIsRunning("a b") + TLIBServiceIsRunning((szMost + "n").c_str()),
+              -3);
+    fnRefused(TLIBServiceIsRunning(szMost.c_str()) + TLIBServiceReload("x") + TLIBServiceRestart("x"), -3,
+              TLIBC_ERR_NOT_FOUND);
+    fnRefused(TAVOLogSet1(2, 1, 1, "x", kNo, kNo, kNo) + TAVOLogSet1(1, 0, 1, "x", kNo, kNo, kNo), -2);
+    fnRefused(TAVOLogSet1(1, 4, 1, "x", kNo, kNo, kNo) + TAVOWriteLog(kNo, 1, 1), -2);
+    fnRefused(TAVOWriteLog("x", 2, 1) + TAVOWriteLog("x", 1, 0), -2);
+    fnRefused(
+        TAVONetIsSameSubnet(kNo, kIp, kIp) + TAVONetIsSameSubnet(kIp, kNo, kIp) + TAVONetIsSameSubnet(kIp, kIp, kNo),
+        -3);
+    fnRefused(
+        TAVONetIsSameSubnet("x", kIp, kIp) + TAVONetIsSameSubnet(kIp, "x", kIp) + TAVONetIsSameSubnet(kIp, kIp, "x"),
+        -3);
+    fnRefused(TLIBNetGetInterfaceInfo(&card, 0, 1) + TAVONetGetCard1(-1, &card) + TAVONetGetCard1(0, nullptr), -3);
+    fnRefused(checkGwIfEnable(nullptr, 9) + checkGwIfEnable(szText, 0) + TAVONetGatewayAsk(nullptr), -3);
+    fnRefused(checkDefaultGatewaySetting(nullptr, 9) + checkDefaultGatewaySetting(szText, 0), -2);
+    fnRefused(RouterDBList(nullptr) + TAVOPFRuleBuildByPath(nullptr, kNo) + TAVOPFRuleBuildByPath(nullptr, ""), -3);
+    fnRefused(TAVOPFCountJobNumber(nullptr, kNo, "PF add port") + TAVOPFCountJobNumber(nullptr, kIp, kNo), -2);
+    fnRefused(TAVOPFCountJobNumber(nullptr, kIp, "PF del port"), -1);
+    EXPECT_STREQ(szText, "as it was");
+    EXPECT_EQ(Read(kPath) + Read(kKeys), "[s]\nk=v\nk=v\n");
+    EXPECT_EQ(fnNull(pOut) + fnNull(TLIBCSzListGet(nullptr, 0)) + fnNull(TLIBCSzListGet(pList, -1)), -3);
+    EXPECT_TRUE(TLIBCSzListGet(pList, 1) == nullptr && TLIBCSzListGet(pList, 0) != nullptr);
+    EXPECT_EQ(TLIBCSzHashGetAt(nullptr, 0, &szKey, &szValue) + TLIBCSzHashGetAt(pHash, -1, &szKey, &szValue), 0);
+    EXPECT_EQ(TLIBCSzHashGetAt(pHash, 1, &szKey, &szValue) + TLIBCSzHashGetAt(pHash, 0, &szKey, &szValue), 1);
+    EXPECT_EQ(TLIBCSzHashGetAt(pHash, 0, nullptr, &szValue) + TLIBCSzHashGetAt(pHash, 0, &szKey, nullptr), 0);
+    EXPECT_EQ(fnValue(kPath, "s", "k", szText, 1) + TLIBCFileGetKeyValue(kKeys, "k", szText, 1, 0), 1);
+    EXPECT_STREQ(szText, "");
+    EXPECT_EQ(fnSet("k", "%s=%s%%\n") + TLIBCKill("nobody", NSIG - 1), 1);
+    EXPECT_EQ(BlTLIBIsIpAddr(kNo) + BlTLIBIsIpAddr("") + BlTLIBIsIpAddr("1.2.3.4 ") + BlTLIBIsIpAddr(kIp), 1);
+    EXPECT_EQ(TAVONetIsSameSubnet(kIp, "1.9.9.9", "255.0.0.0") - TAVONetIsSameSubnet(kIp, "2.1.1.1", "255.0.0.0"), 1);
+    EXPECT_EQ(TAVOPFIsValidPortNo(0) + TAVOPFIsValidPortNo(1) + TAVOPFIsValidPortNo(65535) + TAVOPFIsValidPortNo(65536),
+              2);
+    TLIBCSzHashFree(pHash);
+    TLIBCSzListFree(pList);
+}
+
+TEST(Process, APidFileHoldsTheNumberOfAProcess) {
+    for (const auto& [szText, pid] : {std::pair<const char*, pid_t>{"1\n", 1},
+                                      {"2147483647", INT32_MAX},
+                                      {"0", -1},
+                                      {"2147483648", -1},
+                                      {"x", -1}}) {
+        Write("/tmp/t/pid", szText);
+        EXPECT_EQ(TLIBCReadPidFile("/tmp/t/pid"), pid) << szText;
+    }
+}
+
+// Without systemd and with it: what is run for a service, by which name, and what becomes of its exit status.
+TEST(Service, IsAskedForByTheSystemsNameAndItsManager) {
+    constexpr char kUnit[] = "/etc/systemd/system/playedd.service";
+    constexpr char kDaemon[] = "/usr/tavo/sbin/playedd";
+    constexpr const char* kPrograms[] = {"/etc/init.d/avahi-daemon", "/etc/init.d/other", "/usr/local/sbin/systemctl"};
+    for (const char* szProgram : kPrograms) {
+        Write(szProgram, "#!/bin/sh\necho ${0##*/} \"$@\" >> /tmp/t/said\nexit $(cat /tmp/t/exit)\n");
+        chmod(szProgram, 0755);
+    }
+    Write("/etc/tavo/platform.conf", "[services]\nplayed=\"other\"\nbad=\"-x\"\n");
+    for (const int nCase : {0, 3, 10, 13}) {  // the exit status; of systemd from 10 on
+        const bool blGood = nCase % 10 == 0;
+        Write("/tmp/t/exit", std::to_string(nCase % 10));
+        Write("/tmp/t/said", "");
+        if (nCase >= 10) {
+            std::filesystem::create_directories("/run/systemd/system");
+        }
+        EXPECT_EQ(TLIBServiceIsRunning("avahi"), blGood ? 1 : 0);
+        EXPECT_EQ(TLIBServiceReload("avahi"), blGood ? 0 : -1);
+        EXPECT_EQ(TLIBServiceRestart("played"), blGood ? 0 : -1);
+        EXPECT_EQ(TLIBServiceRestart("bad"), -1);
+        EXPECT_EQ(Read("/tmp/t/said"), nCase < 10 ? "avahi-daemon status\navahi-daemon reload\nother restart\n"
+                                                  : "systemctl is-active avahi-daemon.service\nsystemctl reload "
+                                                    "avahi-daemon.service\nsystemctl restart other.service\n");
+        // A daemon of ours that has a unit is the manager's, but with arguments it is for whoever starts it.
+        Write("/tmp/t/said", "");
+        EXPECT_EQ(TLIBCExec(kDaemon, nullptr, nullptr, nullptr, nullptr), -1) << "neither unit nor program";
+        Write(kUnit, "");
+        EXPECT_EQ(TLIBCExec(kDaemon, "-x", nullptr, nullptr, nullptr), -1);
+        EXPECT_EQ(TLIBCExec(kDaemon, nullptr, nullptr, nullptr, nullptr), nCase == 10 ? 0 : -1);
+        EXPECT_EQ(Read("/tmp/t/said"),
+                  nCase < 10 ? "" : "systemctl reset-failed playedd.service\nsystemctl start playedd.service\n");
+        std::filesystem::remove(kUnit);
+    }
+    for (const char* szMade : {kPrograms[0], kPrograms[1], kPrograms[2], "/run/systemd", "/etc/tavo/platform.conf"}) {
+        std::filesystem::remove_all(szMade);
+    }
+}
 
 TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
     const std::vector<std::string> rgValues = {"",      "plain", "two words",    "x\"; [192.168.1.1]\nuser=\"me",
@@ -374,6 +519,15 @@ TEST(RouterDatabase, ARefreshThatIsKilledOrFailsLosesNothing) {
     for (const char* szPlace : {"/etc.defaults/portforward", "/etc/tavo/platform.conf", "/usr/tavo/bin/wget"}) {
         std::filesystem::remove_all(szPlace);
     }
+}
+
+TEST(RunKeys, AreOnByTheWholeWordOnly) {
+    for (const auto& [szConf, blOn] :
+         {std::pair{"k=\"yes\"\n", true}, {"k=\"no\"\n", false}, {"k=\"yes!\"\n", false}, {"", false}}) {
+        Write("/etc/tavoinfo.conf", szConf);
+        EXPECT_EQ(tavo::IsRunKeyOn("k"), blOn) << szConf;
+    }
+    std::filesystem::remove("/etc/tavoinfo.conf");
 }
 
 }  // namespace
