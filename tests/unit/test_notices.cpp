@@ -1,11 +1,16 @@
 // What is told to a user, and what is not: whole stories of passes, with the memory written and read between them.
 #include <gtest/gtest.h>
 #include <json/json.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
+#include <cstring>
 #include <sstream>
 
 #include "programs/common/Teller.h"
 #include "programs/common/ToldFile.h"
+#include "world.h"
 
 namespace {
 
@@ -166,21 +171,38 @@ TEST(Notices, WhatChangesAllTheTimeIsToldAFewTimesAndItsOutcomeInTheEnd) {
               News{"port-lost: 80/tcp (web): the router's table of ports is full"});
 }
 
-TEST(Notices, ManyPortsWithOneFateAreToldOfInOneLine) {
-    Pass before;
-    Pass after;
-    for (int i = 0; i < 60; ++i) {
-        before.rgszPorts.push_back(std::to_string(8000 + i) + " open");
-        after.rgszPorts.push_back(std::to_string(8000 + i) + " 728");
+// At the edges of the hour within which four are enough; a clock that was set back has told of nothing yet.
+TEST(Notices, WhatHasBeenToldOftenIsToldAgainAfterAnHour) {
+    for (const auto& [nAfter, nTold] : {std::pair<time_t, size_t>{3599, 0}, {3600, 1}, {-10, 1}}) {
+        Story story;
+        for (int i = 0; i < 5; ++i) {  // the first is what was asked for
+            story.Tell({.rgszPorts = {i % 2 == 0 ? "80 open" : "80 728"}, .nAfter = i == 0 ? 120 : 0});
+        }
+        EXPECT_EQ(story.Tell({.rgszPorts = {"80 728"}, .nAfter = nAfter}).size(), nTold) << nAfter;
     }
-    Story story;
-    EXPECT_EQ(story.Tell(before), News{});
-    const News rgNews = story.Tell(after);
-    ASSERT_EQ(rgNews.size(), 1U);
-    EXPECT_TRUE(rgNews[0].starts_with("port-lost: 8000/tcp (web), 8001/tcp (web), ")) << rgNews[0];
-    EXPECT_LT(rgNews[0].size(), 700U);
-    EXPECT_EQ(story.Tell(after), News{});
-    EXPECT_EQ(story.Tell(before).size(), 1U);
+}
+
+TEST(Notices, ManyPortsWithOneFateAreToldOfInOneLine) {
+    for (const auto& [nPorts, nLines, szEnd] :
+         {std::tuple{8, 8U, "8007/tcp (web): the router's table of ports is full"},
+          {9, 1U, ", 8008/tcp (web); the first: the router's table of ports is full"},
+          {33, 1U, ", 8032/tcp (web); the first: the router's table of ports is full"},  // 33 take 526 bytes
+          {34, 1U, ", 8032/tcp (web) and 1 more; the first: the router's table of ports is full"}}) {
+        Pass before;
+        Pass after;
+        for (int i = 0; i < nPorts; ++i) {
+            before.rgszPorts.push_back(std::to_string(8000 + i) + " open");
+            after.rgszPorts.push_back(std::to_string(8000 + i) + " 728");
+        }
+        Story story;
+        EXPECT_EQ(story.Tell(before), News{});
+        const News rgNews = story.Tell(after);
+        ASSERT_EQ(rgNews.size(), nLines);
+        EXPECT_TRUE(rgNews[0].starts_with("port-lost: 8000/tcp (web)")) << rgNews[0];
+        EXPECT_TRUE(rgNews.back().ends_with(szEnd)) << rgNews.back();
+        EXPECT_EQ(story.Tell(after), News{});
+        EXPECT_EQ(story.Tell(before).size(), nLines);
+    }
 }
 
 TEST(Notices, SinceSaysWhenAThingBecameAsItIs) {
@@ -217,6 +239,143 @@ TEST(Notices, AHostileTextStaysAText) {
     EXPECT_EQ(js["rules"].size(), 1U);
     EXPECT_EQ(js["rules"][0]["holder"]["description"].asString(), outcome.verdict.holder->szDescription);
     EXPECT_TRUE(js["router"].isNull());
+}
+
+// Numbers and words that no daemon can have written, in the place of those that are there.
+TEST(Notices, TheMemoryIsReadAsItWasWrittenAndWithinItsBounds) {
+    const std::string szWhole =
+        "[router]\ngateway=\"192.168.1.1\"\nhardware=\"00:00:00:00:00:01\"\noutside=\"198.51.100.1\"\n"
+        "state=\"silent\"\nsince=\"1700000000\"\nfailing=\"1\"\ngone=\"yes\"\nwithdrawn=\"yes\"\n\n"
+        "[port 80/tcp]\nbox_port=\"8080\"\nstate=\"waiting\"\nword=\"718\"\nsince=\"1700000001\"\ntold=\"open\"\n\n"
+        "[told 80/tcp]\ntimes=\"1 2 3 4 5 6 7 8 9 10 11 12 13 14 15 16\"\n\n";
+    for (const auto& [szOld, szOdd, szRead] : {std::tuple{"=\"1\"", "=\"1\"", "=\"1\""},
+                                               {"=\"1\"", "=\"1001\"", "=\"1000\""},
+                                               {"=\"1\"", "=\"-1\"", "=\"0\""},
+                                               {"8080", "65536", "65535"},
+                                               {"8080", "-1", "0"},
+                                               {" 16", " 16 17", " 16"},
+                                               {" 16", " x 17", ""},
+                                               {"waiting", "x", "unknown"}}) {
+        std::string szChanged = szWhole;
+        std::string szWanted = szWhole;
+        szChanged.replace(szChanged.find(szOld), strlen(szOld), szOdd);
+        szWanted.replace(szWanted.find(szOld), strlen(szOld), szRead);
+        EXPECT_EQ(FormatTold(tavo::ParseTold(szChanged)), szWanted) << szOdd;
+    }
+}
+
+TEST(Published, SaysWhatIsKnownAndNullForTheRest) {
+    tavo::Published state{"played", "NAT-PMP", kStart, true, false};
+    state.enRouter = RouterState::kNoService;
+    for (const auto& [szPort, szProtocol, enState] : {std::tuple{"80 open", "TCP", PortState::kOpen},
+                                                      {"81 718", "UDP", PortState::kRefused},
+                                                      {"82 606", "", PortState::kWaiting},
+                                                      {"0 x", "TCP", PortState::kUnknown},
+                                                      {"84 open", "TCP", PortState::kOpen}}) {
+        state.rgOutcomes.push_back(Port(szPort));
+        state.rgOutcomes.back().szProtocol = szProtocol;
+        state.rgOutcomes.back().verdict.enState = enState;
+    }
+    state.rgOutcomes[0].verdict.nLease = 60;
+    state.rgOutcomes[0].nSince = kStart - 1;
+    state.rgOutcomes[4].blLeftOver = true;
+    Publish(state);
+    Json::Value js;
+    std::istringstream(Read("/run/tavo/played.json")) >> js;
+    EXPECT_EQ(std::filesystem::status("/run/tavo/played.json").permissions(), std::filesystem::perms(0644));
+    std::string szRows;
+    for (const Json::Value& row : js["rules"]) {
+        for (const char* szName : {"router_port", "box_port", "protocol", "state", "since", "until"}) {
+            szRows += row[szName].isNull() ? "- " : row[szName].asString() + " ";
+        }
+    }
+    EXPECT_EQ(szRows,
+              "80 80 tcp open 1699999999 1700000060 81 81 udp refused - - 82 82 - waiting - - - - tcp unknown - - ");
+    EXPECT_EQ(js["left_over"][0]["name"].asString() + js["router"].asString(), "84/tcpno_natpmp");
+    EXPECT_TRUE(js["switched_on"].asBool() && !js["rules_readable"].asBool() && js["gateway"].isNull());
+    EXPECT_EQ(js["pid"].asInt(), getpid());
+    tavo::Unpublish("played");
+    EXPECT_FALSE(std::filesystem::exists("/run/tavo/played.json"));
+}
+
+TEST(Teller, TellsTheLogsOfEachChangeAndTheHooksOfOnePortAlone) {
+    constexpr char kEvents[] = "/var/log/tavo/event.log";
+    tavo::Published state{"upnpd", "UPnP"};
+    state.szRouterWhy = "why";
+    std::string szLevels;
+    for (int i = 0; i <= static_cast<int>(tavo::Change::kRenewed); ++i) {
+        std::filesystem::remove(kEvents);
+        gLog.clear();
+        tavo::Notice notice{static_cast<tavo::Change>(i), "the text"};
+        tavo::Teller().Tell(notice, state);
+        const std::string szEvent = Read(kEvents);
+        szLevels += szEvent.find(" warning 0x") != std::string::npos ? "w"
+                    : szEvent.find(" info 0x") != std::string::npos  ? "i"
+                                                                     : "?";
+        EXPECT_TRUE(gLog.size() == 1 && gLog[0].ends_with(": the text") && szEvent.ends_with(gLog[0] + "\n"))
+            << szEvent;
+        for (const char* szWanted : {"80 tcp 80 192.168.1.7 console", "    "}) {  // of one port, of two
+            notice.rgPorts.push_back(Port("80 718 192.168.1.7 console"));
+            const std::vector<std::string> rgszFacts = HookFacts(notice, state);
+            std::string szPort;
+            for (const size_t nFact : {6U, 7U, 8U, 11U, 12U}) {
+                szPort +=
+                    (szPort.empty() && nFact == 6 ? "" : " ") + rgszFacts[nFact].substr(rgszFacts[nFact].find('=') + 1);
+            }
+            EXPECT_EQ(szPort, szWanted);
+            EXPECT_EQ(rgszFacts[10] == "TAVO_WHY=why", notice.enChange == tavo::Change::kRouterGone) << rgszFacts[10];
+        }
+    }
+    EXPECT_EQ(szLevels, "wwiwiiii");
+    std::filesystem::remove_all("/var/log/tavo");
+}
+
+// What reaches the runner, and when there is none, one that has ended, or one that does not keep up.
+TEST(HookQueue, PassesOnWhatFitsAndSaysWhatDoesNot) {
+    static constexpr char kRunner[] = "/usr/tavo/bin/tavohook";
+    const std::string szLost = "notice was not passed on to the hooks in /etc/tavo/hooks.d";
+    const auto fnRunner = [](const char* szDoes) {
+        Write(kRunner, std::string("#!/bin/sh\necho $$ > /tmp/t/runner\n") + szDoes);
+        chmod(kRunner, 0755);
+    };
+    const auto fnGot = [](const std::string& szWanted) {
+        for (int i = 0; i < 500 && Read("/tmp/t/facts") != szWanted; ++i) {
+            usleep(10000);
+        }
+        return Read("/tmp/t/facts") == szWanted;
+    };
+    for (const char* szPath : {"/etc/tavo/hooks.d", "/tmp/t"}) {
+        std::filesystem::remove_all(szPath);
+    }
+    fnRunner("exec cat >> /tmp/t/facts");
+    gLog.clear();
+    const std::string szMost(16384 - 3, 'x');
+    {
+        tavo::HookQueue queue;
+        queue.Run({"A=0"});  // no hook, no runner
+        Write("/etc/tavo/hooks.d/10-a", "");
+        std::filesystem::create_directories("/tmp/t");
+        queue.Run({"A=1", "B=2"});
+        queue.Run({"A=" + szMost});
+        EXPECT_EQ(gLog, std::vector<std::string>());
+        queue.Run({"A=" + szMost + "x"});
+        EXPECT_EQ(gLog, std::vector<std::string>{szLost});
+        EXPECT_TRUE(fnGot(std::string("A=1\0B=2\0A=", 10) + szMost + '\0'));
+        kill(std::stoi(Read("/tmp/t/runner")), SIGKILL);
+        usleep(100000);
+        std::filesystem::remove("/tmp/t/facts");
+        fnRunner("exec sleep 60");
+        for (gLog.clear(); gLog.empty();) {
+            queue.Run({"C=" + std::string(1000, 'x')});  // it never waits
+        }
+        EXPECT_EQ(gLog, std::vector<std::string>{szLost});
+        kill(std::stoi(Read("/tmp/t/runner")), SIGKILL);
+    }
+    std::filesystem::remove(kRunner);
+    gLog.clear();
+    tavo::HookQueue().Run({"A=1"});
+    EXPECT_EQ(gLog, (std::vector<std::string>{"run /usr/tavo/bin/tavohook: No such file or directory", szLost}));
+    std::filesystem::remove_all("/etc/tavo/hooks.d");
 }
 
 TEST(Notices, ADamagedMemoryIsNothingTold) {
