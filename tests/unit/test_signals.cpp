@@ -1,12 +1,22 @@
 // A daemon's signals: one that comes between two looks at the queue ends the wait that follows; and what the frame of a
 // daemon makes of them, with passes that the test plays.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <chrono>
+#include <cstring>
 
+#include "ground/Descriptor.h"
 #include "programs/common/Daemon.h"
+#include "programs/common/Instance.h"
 #include "programs/common/SignalQueue.h"
+#include "programs/common/Watch.h"
+#include "tavo/core.h"
 #include "world.h"
 
 namespace {
@@ -58,21 +68,51 @@ public:
         }
         return mNSeconds;
     }
-    bool IsSwitchedOn() const override { return true; }
-    bool Withdraw(const std::function<bool()>&) override {
+    bool IsSwitchedOn() const override { return mBlOn; }
+    bool Withdraw(const std::function<bool()>& fnStop) override {
         Tell("withdraw");
-        return true;
+        int nLooks = 1;
+        while (mBlSlow && !fnStop()) {
+            ++nLooks;
+        }
+        mBlSlow ? Tell(std::to_string(nLooks)) : void();
+        return !mBlSlow;
     }
-    std::vector<int> WakeFds() const override { return {}; }
-    bool OnWake() override { return false; }
+    std::vector<int> WakeFds() const override { return {mFdWord}; }
+    bool OnWake() override {
+        char cWord = 0;
+        return read(mFdWord, &cWord, 1) == 1 && cWord == 'y';
+    }
     bool OnNetworkChange() override { return false; }
     static void Tell(const std::string& szLine) { std::ofstream(kNames.szResultFile, std::ios::app) << szLine << "\n"; }
     int mNSeconds = 1;
+    bool mBlOn = true;
+    bool mBlSlow = false;  // the router does not let its mappings go
+    int mFdWord = -1;
 
 private:
     OnPass mFnOnPass;
     int mNPasses = 0;
 };
+
+// In a process of its own; its exit status.
+int InChild(const std::function<int()>& fnRun) {
+    fflush(stdout);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        gNClockJumped = 0;
+        _exit(fnRun());
+    }
+    int nStatus = -1;
+    EXPECT_EQ(waitpid(pid, &nStatus, 0), pid);
+    return WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : -1;
+}
+
+int RunPlayed(PlayedMapper& mapper, std::string szOption = "--foreground", std::string szSecond = "") {
+    char szName[] = "played";
+    char* rgszArguments[] = {szName, szOption.data(), szSecond.data(), nullptr};
+    return DaemonMain(szOption.empty() ? 1 : szSecond.empty() ? 2 : 3, rgszArguments, mapper);
+}
 
 TEST(Daemon, PassesFollowTheirSignals) {
     const auto fnEndAfter = [](int nPass, int nPasses, int nSignal) {
@@ -104,23 +144,180 @@ TEST(Daemon, PassesFollowTheirSignals) {
              }
              fnEndAfter(nPass, 3, SIGTERM);
          },
-         "clean\nrequest cut\nmarked\nrequest whole\nclean\nclock cut\nwithdraw\n"}};
+         "clean\nrequest cut\nmarked\nrequest whole\nclean\nclock cut\nwithdraw\n"},
+        {"a marker of a start that comes while nothing is to be done goes at once",
+         [&](int nPass) {
+             const std::string szRest = "kill -TERM " + std::to_string(getpid()) + ") &";
+             fnEndAfter(nPass, 2, SIGTERM);
+             TLIBCSystem(
+                 ("(sleep .2; touch /tmp/pfProgress; sleep .3; ls /tmp/pfProgress >> /tmp/played.out 2>&-; " + szRest)
+                     .c_str());
+         },
+         "request whole\nwithdraw\n"}};
     for (const auto& [szWhat, fnOnPass, szStory] : rgCases) {
         std::filesystem::remove(kNames.szResultFile);
-        const pid_t pid = fork();
-        if (pid == 0) {
-            gNClockJumped = 0;
-            PlayedMapper mapper(fnOnPass);
-            char szName[] = "played";
-            char szOption[] = "--foreground";
-            char* rgszArguments[] = {szName, szOption, nullptr};
-            _exit(DaemonMain(2, rgszArguments, mapper));
-        }
-        int nStatus = -1;
-        EXPECT_EQ(waitpid(pid, &nStatus, 0), pid);
-        EXPECT_EQ(nStatus, 0) << szWhat;
+        EXPECT_EQ(InChild([&] {
+                      PlayedMapper mapper(fnOnPass);
+                      mapper.mNSeconds = szStory == "request whole\nwithdraw\n" ? 60 : 1;
+                      return RunPlayed(mapper);
+                  }),
+                  0)
+            << szWhat;
         EXPECT_EQ(Read(kNames.szResultFile), szStory) << szWhat;
         EXPECT_FALSE(std::filesystem::exists(kNames.szPidFile) || std::filesystem::exists(kMarker)) << szWhat;
+    }
+}
+
+TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
+    struct Case {
+        const char* szOption;
+        int nExit;
+        const char* szStory = "";
+        bool blHeld = false;  // by somebody who does not end
+        bool blOn = true;
+        bool blSlow = false;
+        const char* szSecond = "";
+    };
+    const Case rgCases[] = {
+        {"--help", 0},
+        {"--hepl", 2},
+        {.szOption = "--help", .nExit = 2, .szSecond = "--stop"},
+        {.szOption = "--foreground", .nExit = 2, .szSecond = "--stop"},
+        {"--make-locks", 0},
+        {"--hand-over", 0},
+        {"--hand-over", 1, "", true},
+        {"--foreground", 1, "", true},
+        {.szOption = "--foreground", .nExit = 1, .blHeld = true, .szSecond = "--take-over"},
+        {.szOption = "--foreground", .nExit = 0, .szStory = "request cut\n", .szSecond = "--take-over"},
+        {"", 1, "", true},
+        {"--stop", 0, "withdraw\n"},
+        {"--stop", 0, "", false, false},
+        {"--stop", 1, "", true},
+        {"--stop", 1, "withdraw\n10\n", false, true, true}};  // ten seconds and no longer
+    std::filesystem::create_directories("/tmp/t");
+    for (const Case& one : rgCases) {
+        std::filesystem::remove(kNames.szResultFile);
+        tavo::Instance holder(kNames.szLockFile);
+        ASSERT_TRUE(!one.blHeld || holder.Take());
+        Write(one.blHeld ? kNames.szLockFile : "/tmp/t/none", "x");  // it does not say who it is
+        EXPECT_EQ(InChild([&] {
+                      PlayedMapper mapper([](int) { raise(SIGUSR1); });
+                      mapper.mBlOn = one.blOn;
+                      mapper.mBlSlow = one.blSlow;
+                      gNClockStep = one.blHeld || one.blSlow ? 1 : 0;  // the limits of a stop go by faster
+                      dup2(open("/tmp/t/said", O_WRONLY | O_CREAT | O_TRUNC, 0600), STDOUT_FILENO);
+                      dup2(open("/dev/null", O_WRONLY), STDERR_FILENO);
+                      const int nExit = RunPlayed(mapper, one.szOption, one.szSecond);
+                      fflush(stdout);
+                      return nExit;
+                  }),
+                  one.nExit)
+            << one.szOption << one.szSecond << one.blHeld;
+        EXPECT_EQ(Read(kNames.szResultFile), one.szStory) << one.szOption;
+        EXPECT_EQ(Read("/tmp/t/said").starts_with("Usage: played ["), &one == rgCases);
+    }
+}
+
+// A word of the router brings the next pass near, but not nearer than a few seconds after the last such pass.
+TEST(Daemon, AWordOfTheRouterIsHeardSoonAndNotTooOften) {
+    std::filesystem::remove(kNames.szResultFile);
+    int rgFd[2];
+    ASSERT_EQ(pipe2(rgFd, O_CLOEXEC | O_NONBLOCK), 0);
+    EXPECT_EQ(InChild([&] {
+                  auto last = std::chrono::steady_clock::now();
+                  PlayedMapper mapper([&](int nPass) {
+                      const std::chrono::duration<double> pause = std::chrono::steady_clock::now() - last;
+                      last += std::chrono::duration_cast<std::chrono::nanoseconds>(pause);
+                      PlayedMapper::Tell(pause.count() < 0.9   ? "at once"
+                                         : pause.count() < 2   ? "soon"
+                                         : pause.count() < 4.9 ? "?"
+                                                               : "later");
+                      if (write(rgFd[1], "y", 1) == 1 && nPass == 3) {
+                          raise(SIGTERM);
+                      }
+                  });
+                  mapper.mNSeconds = 60;
+                  mapper.mFdWord = rgFd[0];
+                  return RunPlayed(mapper);
+              }),
+              0);
+    EXPECT_EQ(Read(kNames.szResultFile), "at once\nrequest whole\nsoon\nclock whole\nlater\nclock cut\nwithdraw\n");
+    close(rgFd[0]);
+    close(rgFd[1]);
+}
+
+// Where a service manager listens, by a path or by an abstract name.
+TEST(Daemon, TheServiceManagerHearsThatTheWorkHasBegun) {
+    std::filesystem::create_directories("/tmp/t");
+    for (const char* szName : {"/tmp/t/notify", "@played"}) {
+        const tavo::Descriptor fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+        sockaddr_un address = {AF_UNIX, {}};
+        std::memcpy(address.sun_path, szName, strlen(szName));
+        address.sun_path[0] = *szName == '@' ? '\0' : *szName;
+        const auto nLength = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + strlen(szName));
+        ASSERT_EQ(bind(fd.Get(), reinterpret_cast<sockaddr*>(&address), nLength), 0);
+        EXPECT_EQ(InChild([&] {
+                      PlayedMapper mapper([](int) { raise(getenv("NOTIFY_SOCKET") == nullptr ? SIGTERM : SIGKILL); });
+                      setenv("NOTIFY_SOCKET", szName, 1);
+                      return RunPlayed(mapper);
+                  }),
+                  0);
+        char szText[20] = {};
+        EXPECT_EQ(recv(fd.Get(), szText, sizeof(szText), 0), 7);
+        EXPECT_STREQ(szText, "READY=1");
+    }
+}
+
+TEST(Instance, APidCountsWhileItsProcessHoldsTheLock) {
+    constexpr char kLock[] = "/run/played.other";
+    EXPECT_EQ(tavo::Instance(kLock).Holder(), 0) << "no file";
+    {
+        tavo::Instance instance(kLock);
+        ASSERT_TRUE(instance.Take());
+        EXPECT_EQ(Read(kLock), std::to_string(getpid()) + "\n");
+        EXPECT_FALSE(tavo::Instance(kLock).Take());
+        for (const auto& [szText, pid] : {std::pair{"", -1}, {"x", -1}, {"0", -1}, {"1", -1}, {"-5", -1}, {"2", 2}}) {
+            Write(kLock, szText);
+            EXPECT_EQ(tavo::Instance(kLock).Holder(), pid) << szText;
+        }
+    }
+    EXPECT_EQ(tavo::Instance(kLock).Holder(), 0) << "left over";
+    std::filesystem::remove(kLock);
+    std::filesystem::create_symlink("/tmp/victim", kLock);
+    EXPECT_EQ(tavo::Instance(kLock).Holder(), -1);
+    EXPECT_FALSE(tavo::Instance(kLock).Take());
+    std::filesystem::remove(kLock);
+}
+
+// Ten crashes are too many within ten minutes, of which so many seconds go by between two looks at the clock.
+TEST(Watch, ACrashIsFollowedByANewStartUnlessItIsTheTenth) {
+    static constexpr char kStarts[] = "/tmp/t/starts";
+    for (const auto& [szWhat, nStep, nSignal, nEnd, nExit, nStarts] :  // the signal comes at the second start
+         {std::tuple{"too many", 16, 0, 99U, 1, 10U},
+          {"not so many in the time", 17, 0, 12U, 7, 12U},
+          {"an end is no crash", 16, 0, 1U, 7, 1U},
+          {"stopped", 16, SIGTERM, 99U, 1, 2U},
+          {"handed over", 16, SIGUSR1, 99U, 1, 2U}}) {
+        std::filesystem::create_directories("/tmp/t");
+        std::filesystem::remove(kStarts);
+        const auto fnWork = [nSignal = nSignal, nEnd = nEnd] {
+            std::ofstream(kStarts, std::ios::app) << "x";
+            const auto nStart = std::filesystem::file_size(kStarts);
+            if (nStart == nEnd) {
+                return 7;
+            }
+            kill(getppid(), nStart == 2 ? nSignal : 0);
+            usleep(20000);
+            return raise(SIGKILL);
+        };
+        EXPECT_EQ(InChild([&, nStep = nStep] {
+                      gNClockStep = nStep;
+                      char szTitle[] = "played --and-more";
+                      return tavo::Watch("played", szTitle).Run(fnWork);
+                  }),
+                  nExit)
+            << szWhat;
+        EXPECT_EQ(Read(kStarts).size(), nStarts) << szWhat;
     }
 }
 
