@@ -8,6 +8,7 @@
 #include <csignal>
 #include <set>
 
+#include "ground/TextFile.h"
 #include "libtavoportmap.h"
 #include "network.h"
 #include "stage.h"
@@ -262,6 +263,91 @@ TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
     }
     EXPECT_EQ(TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p"), 0);  // SIGHUP ended it
     EXPECT_FALSE(std::filesystem::exists(kProgress));
+}
+
+// The test client itself, without a router: what it answers while no daemon runs, and what one that runs is told.
+TEST_F(RouterTests, TheClientOrdersWhatIsAskedOfItAndEndsTheDaemonWhenItGivesUp) {
+    gPNetwork = nullptr;
+    gPClient = nullptr;
+    static constexpr char kRules[] = "/var/lib/tavo/upnp_test.conf";
+    static constexpr char kDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";
+    std::filesystem::remove(kRules);
+    std::error_code error;
+    std::filesystem::rename("/usr/tavo/sbin/upnpd", "/usr/tavo/sbin/aside", error);  // another test's
+    for (const auto& [szFirst, nRules, szWanted, nWanted] : {std::tuple{"", 3, "24500", 3},
+                                                             {"1023", 1, "1024", 1},
+                                                             {"1025", 1, "1025", 1},
+                                                             {"60001", 1, "60000", 1},
+                                                             {"59999", 1001, "59999", 1000},
+                                                             {"", 1, "24500", 1},
+                                                             {"", 0, "24500", 1}}) {
+        Write("/etc/tavo/platform.conf",
+              *szFirst == '\0' ? "" : std::string("[upnptest]\nfirst_port=\"") + szFirst + "\"\n");
+        EXPECT_EQ(TAVOUPnPAddTest(nRules), -1) << "there is no program to do it";
+        EXPECT_EQ(TLIBCErrGet(), nRules < 1 ? TLIBC_ERR_BAD_PARAMETER : TLIBC_ERR_EXEC);
+        const auto rgSections = *tavo::ParseSections(Read(kRules));
+        EXPECT_EQ(rgSections.size(), static_cast<size_t>(nWanted)) << szFirst << nRules;
+        EXPECT_EQ(rgSections[0].rgPairs[0].szValue + rgSections[0].rgPairs[1].szValue,
+                  std::string(szWanted) + szWanted);
+    }
+    std::filesystem::remove("/etc/tavo/platform.conf");
+    EXPECT_TRUE(std::filesystem::exists("/var/tmp/upnp_portmap.status") &&
+                std::filesystem::exists("/tmp/pfStatusRule"));
+    const auto fnKept = [](bool blKept) {
+        Write(kRules, std::string("[1]\nr_port=7\ns_port=8\nenabled=") + (blKept ? "1" : "0") + "\nresult=1\n");
+    };
+    const auto fnWait = [](const std::function<bool()>& fnTrue) {
+        for (int i = 0; i < 500 && !fnTrue(); ++i) {
+            usleep(10000);
+        }
+    };
+    using Ask = std::function<int()>;
+    const auto fnMarker = [](const char* szWanted) {
+        return std::string("wanted=\"") + szWanted + "\"\n7/tcp=\"8\"\nresult=\"failed\"\n";
+    };
+    for (const auto& [szWhat, fnAsk, nAlone, nAnswer, szOrder, szMarker] :  // without a daemon, and with one
+         {std::tuple<const char*, Ask, int, int, std::string, std::string>{
+              "modify", [] { return TAVOUPnPModifyRule(); }, -1, 0, "modify", ""},
+          {"end", [] { return Put("upnp_terminal", "processing"), TAVOUPnPDeletetest(); }, -1, 0, "end", ""},
+          {"delete", [] { return Put("upnp_terminal", "finished"), TAVOUPnPDeletetest(); }, -1, 0, "delete", ""},
+          {"a second test", [] { return TAVOUPnPAddTest(1); }, -1, -1, "", ""},
+          {"no limit", [] { return TAVOUPnPSetupTest(0, 0); }, -1, -1, "end", ""},
+          {"flags", [] { return TAVOUPnPSetupTest(60, 1); }, -1, -1, "end", ""},
+          {"a limit", [] { return TAVOUPnPSetupTest(1, 0); }, -1, 0, "", ""},
+          {"none held", [&] { return fnKept(false), TAVOUPnPCountMaxRule(); }, 0, 0, "end", ""},
+          {"no router", [&] { return fnKept(true), TAVOUPnPCountMaxRule(); }, -1, -1, "end", ""},
+          {"no ports", [&] { return fnKept(false), TAVOUPnPPortTest(1); }, -1, -1, "end", ""},
+          {"open", [&] { return fnKept(true), TAVOUPnPPortTest(1); }, -1, -1, "end", fnMarker("open")},
+          {"closed", [&] { return fnKept(true), TAVOUPnPPortTest(0); }, -1, -1, "end", fnMarker("closed")}}) {
+        std::filesystem::remove("/tmp/pfStatusRule");
+        std::filesystem::remove("/tmp/orders");
+        EXPECT_EQ(fnAsk(), nAlone) << szWhat;
+        Write("/tmp/daemon",
+              "$0 = '/usr/tavo/sbin/upnpd --debug -p'; use Socket; socket(S, AF_UNIX, SOCK_DGRAM, 0);"
+              "bind(S, sockaddr_un('/var/run/upnpd_test.sock')); alarm(60); while (recv(S, $m, 99, 0), $m) {"
+              "open(F, '>>/tmp/orders'); print F $m; close(F); exit if $m eq 'end' }");
+        ASSERT_EQ(TLIBCSystem("perl /tmp/daemon >/dev/null 2>&1 &"), 0);
+        fnWait([] { return std::filesystem::exists("/var/run/upnpd_test.sock"); });
+        EXPECT_EQ(fnAsk(), nAnswer) << szWhat;
+        const bool blEnded = TLIBCIsProcAlive(kDaemon) == 0;
+        EXPECT_TRUE(std::string(szWhat) == "end" || blEnded == (szOrder == "end"))
+            << szWhat << ": its end is waited for";
+        fnWait([&] { return Read("/tmp/orders") == szOrder; });
+        TLIBCKill(kDaemon, SIGKILL);
+        fnWait([] { return TLIBCIsProcAlive(kDaemon) == 0; });
+        EXPECT_EQ(Read("/tmp/orders"), szOrder) << szWhat;
+        EXPECT_EQ(Read("/tmp/pfStatusRule"), szMarker) << szWhat;
+        std::filesystem::remove("/var/run/upnpd_test.sock");
+    }
+    EXPECT_EQ(TAVOUpnpRemoveTestRulePath(), 0);
+    EXPECT_FALSE(std::filesystem::exists(kRules));
+    std::filesystem::create_directories(kRules);
+    EXPECT_EQ(TAVOUpnpRemoveTestRulePath(), -1);
+    std::filesystem::remove_all(kRules);
+    EXPECT_EQ(TAVOUpnpReportTestProgress("s", "v", 0), 0);
+    EXPECT_EQ(TAVOUpnpReportTestProgress("", "v", 0), -1);
+    EXPECT_STREQ(GetUPnPReportServer(), "");
+    std::filesystem::rename("/usr/tavo/sbin/aside", "/usr/tavo/sbin/upnpd", error);
 }
 
 TEST_F(RouterTests, RecordIsTheOnlyOne) {
