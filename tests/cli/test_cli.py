@@ -446,6 +446,7 @@ class Tool(unittest.TestCase):
                                                            (1, "udp", "5000-5001,5003-5004", "5000-5001,5003-5004", ""))),
                 ((span,), "close 5000-5002", OK, "closed", ((1, "all", "5003-5004", "5003-5004", ""),)),
                 ((off(web),), "close 443", OK, "nothing to close", (off(web),)),
+                ((span,), "close 443", OK, "nothing to close", (span,)),
                 (((1, "tcp", "80", "80", "443"), web), "close 443", OK, "443 closed", ((1, "tcp", "80", "80", "443"),)),
                 ((web,), "close wbe", USAGE, "neither a port nor the name of a rule", (web,)),
                 ((off(web),), "off", OK, "nothing to switch off", (off(web),)),

@@ -70,6 +70,7 @@ public:
     void NewGateway() override { mRgszCalls.push_back("new " + Gateway() + " " + Box()); }
     void LostRouter() override { mRgszCalls.emplace_back("lost"); }
 
+    using RuleMapper::WishedLease;
     Lines TakeCalls() { return std::exchange(mRgszCalls, {}); }
     int Pass(bool blRequested = false) {
         return Run(blRequested, [this] { return ++mNAsked > 0 && mBlStop; });
@@ -132,6 +133,29 @@ TEST_F(RuleMapping, TheNextPassComesSoonAfterAChangeAndWhenSomethingIsToBeDone) 
     for (const char* szLast : {"map 1", "map 1", "lost"}) {
         EXPECT_EQ(mapper.Pass(), 3);
         EXPECT_EQ(mapper.TakeCalls().back(), szLast);
+    }
+}
+
+// The settings within their bounds: seconds of a router that has nothing to be done, and of a lease.
+TEST_F(RuleMapping, SettingsOutsideTheirBoundsAreAtThem) {
+    for (const auto& [szCheck, szLease, nSeconds, nLease] : {std::tuple{"0", "19", 1, 20U},
+                                                             {"1", "20", 1, 20U},
+                                                             {"3600", "604800", 3600, 604800U},
+                                                             {"3601", "604801", 3600, 604800U},
+                                                             {"x", "x", 1, 20U},
+                                                             {"", "", 120, 3600U}}) {
+        std::filesystem::remove("/etc/tavo/platform.conf");
+        if (*szCheck != '\0') {
+            Write("/etc/tavo/platform.conf",
+                  std::string("[played]\ncheck_interval=\"") + szCheck + "\"\nlease=\"" + szLease + "\"\n");
+        }
+        Played mapper;
+        int nNext = mapper.Pass(true);
+        for (int i = 0; i < 12; ++i) {  // it looks more and more seldom
+            nNext = mapper.Pass();
+        }
+        EXPECT_EQ(nNext, nSeconds);
+        EXPECT_EQ(mapper.WishedLease(), nLease);
     }
 }
 
@@ -217,6 +241,10 @@ TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
         EXPECT_EQ(js["router"], szRouter);
         EXPECT_EQ(js["router_why"].asString().starts_with("the network cable is out"), nInterface != 0) << szRouter;
     }
+    std::filesystem::remove(kNames.szResultFile);
+    std::filesystem::create_directories(kNames.szResultFile);  // is in the way
+    mapper.Pass();
+    EXPECT_TRUE(Logged("write /tmp/played.out"));
     EXPECT_FALSE(mapper.OnNetworkChange());
     mNetwork.nInterface = -1;
     EXPECT_TRUE(mapper.OnNetworkChange());
