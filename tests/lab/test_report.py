@@ -112,13 +112,6 @@ class Report(unittest.TestCase):
         self.assertEqual(test_compat.run(5, "test")["result"], 1)
         self.check_report_of("upnp_add")
 
-    def test_no_test_daemon(self):
-        LAB.start_scripted("none")
-        self.assertEqual(compat("known"), 0)
-        os.unlink("/usr/tavo/sbin/upnpd")
-        self.assertEqual(test_compat.run(5, "test")["result"], 1)
-        self.check_report_of("upnp_add")
-
     def test_a_test_daemon_that_is_killed(self):
         LAB.start_scripted("none")
         self.assertEqual(compat("known"), 0)

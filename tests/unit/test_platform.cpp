@@ -392,6 +392,9 @@ TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
     EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
     const int fd = open("/tmp/t/held", O_RDWR | O_CREAT, 0600);  // deliberately inheritable
     ASSERT_EQ(TLIBCExec("/tmp/t/testupnp.sh", "--one", nullptr, nullptr, nullptr), 0);
+    for (int i = 0; i < 500 && TLIBCIsProcAlive("testupnp.sh") == 0; ++i) {
+        usleep(10000);  // the kernel tells of the program's start a moment before it shows its name
+    }
     EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 1);
     EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh --one"), 1);
     EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh"), 0);

@@ -2,16 +2,11 @@
 // daemon makes of them, with passes that the test plays.
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <poll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 
-#include "ground/Descriptor.h"
 #include "programs/common/Daemon.h"
 #include "programs/common/Instance.h"
 #include "programs/common/SignalQueue.h"
@@ -244,28 +239,6 @@ TEST(Daemon, AWordOfTheRouterIsHeardSoonAndNotTooOften) {
     EXPECT_EQ(Read(kNames.szResultFile), "at once\nrequest whole\nsoon\nclock whole\nlater\nclock cut\nwithdraw\n");
     close(rgFd[0]);
     close(rgFd[1]);
-}
-
-// Where a service manager listens, by a path or by an abstract name.
-TEST(Daemon, TheServiceManagerHearsThatTheWorkHasBegun) {
-    std::filesystem::create_directories("/tmp/t");
-    for (const char* szName : {"/tmp/t/notify", "@played"}) {
-        const tavo::Descriptor fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-        sockaddr_un address = {AF_UNIX, {}};
-        std::memcpy(address.sun_path, szName, strlen(szName));
-        address.sun_path[0] = *szName == '@' ? '\0' : *szName;
-        const auto nLength = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + strlen(szName));
-        ASSERT_EQ(bind(fd.Get(), reinterpret_cast<sockaddr*>(&address), nLength), 0);
-        EXPECT_EQ(InChild([&] {
-                      PlayedMapper mapper([](int) { raise(getenv("NOTIFY_SOCKET") == nullptr ? SIGTERM : SIGKILL); });
-                      setenv("NOTIFY_SOCKET", szName, 1);
-                      return RunPlayed(mapper);
-                  }),
-                  0);
-        char szText[20] = {};
-        EXPECT_EQ(recv(fd.Get(), szText, sizeof(szText), 0), 7);
-        EXPECT_STREQ(szText, "READY=1");
-    }
 }
 
 TEST(Instance, APidCountsWhileItsProcessHoldsTheLock) {
