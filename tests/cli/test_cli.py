@@ -998,6 +998,23 @@ class Tool(unittest.TestCase):
         put(RULES, "")
         self.expect("status", OK, "no rules are in force")
 
+    def test_status_says_what_the_service_manager_has_of_the_daemon(self):
+        """The unit's state by systemctl, whether the daemon lives, and the words that tell of it."""
+        put("/usr/bin/systemctl", "#!/bin/sh\ncat /tmp/unit\n")
+        os.chmod("/usr/bin/systemctl", 0o755)
+        os.makedirs("/run/systemd/system")
+        self.addCleanup(shutil.rmtree, "/run/systemd")
+        for state, alive, code, pattern in (
+                ("loaded failed enabled signal", False, AWAY, r"its unit is failed, signal\); 'sudo journalctl -u upnpd' says"),
+                ("loaded inactive enabled success", False, AWAY, r"its unit is inactive\);(?s:.)*restart upnpd' starts it"),
+                ("not-found inactive - success", False, AWAY, "upnpd does not run; 'sudo tavoportmap save' starts it"),
+                ("loaded active enabled success", True, OK, r"runs, unit active and enabled\)(?s:.)*in force\n$"),
+                ("loaded active disabled success", True, OK, "disabled(?s:.)*in force\nwarning: .*'sudo systemctl enable upnpd'"),
+                ("loaded inactive enabled success", True, OK, "in force\nwarning: .*outside of its unit.*restart upnpd' hands it")):
+            put("/tmp/unit", "LoadState={}\nActiveState={}\nUnitFileState={}\nResult={}\n".format(*state.split()))
+            self.publish(self.keep(alive=alive))
+            self.expect("status", code, pattern)
+
     def test_the_man_page_names_each_member_of_the_status(self):
         self.publish(self.keep(), (443, "tcp", {"holder": {"address": "192.168.77.7", "description": "x"}}),
                      left_over=[{"name": "8080/tcp", "address": "192.168.77.9", "why": "x", "until": None}])
