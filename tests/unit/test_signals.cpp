@@ -211,6 +211,17 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         EXPECT_EQ(Read(kNames.szResultFile), one.szStory) << one.szOption;
         EXPECT_EQ(Read("/tmp/t/said").starts_with("Usage: played ["), &one == rgCases);
     }
+    signal(SIGHUP, SIG_IGN);
+    tavo::Instance parent(tavo::Watch::LockFile(kNames.szName));
+    ASSERT_TRUE(parent.Take());
+    EXPECT_EQ(InChild([] {
+                  gNClockStep = 1;
+                  PlayedMapper mapper([](int) {});
+                  return RunPlayed(mapper, "");
+              }),
+              1)
+        << "a parent that starts nobody";
+    signal(SIGHUP, SIG_DFL);
 }
 
 // A word of the router brings the next pass near, but not nearer than a few seconds after the last such pass.
