@@ -1,4 +1,4 @@
-// The safe replacement of a file, and the parts that other writers take from it. Relies on rename, flock and the
+// The safe replacement of a file, and the parts that other writers take from it. Relies on rename, locks and the
 // platform's files. Promises: nothing is thrown by ReplaceFile; every failure of it is logged.
 #include "ReplaceFile.h"
 
