@@ -11,6 +11,7 @@
 #include <tuple>
 
 #include "ground/BootTimer.h"
+#include "ground/Marks.h"
 #include "ground/PortText.h"
 #include "mapping/Carry.h"
 #include "mapping/Keeper.h"
