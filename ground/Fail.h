@@ -1,6 +1,7 @@
 // How a function of the platform fails: the last error is set, with the place in the tree that saw it.
 #pragma once
 
+#include <algorithm>
 #include <string_view>
 
 #include "tavo/core.h"
@@ -9,12 +10,12 @@ namespace tavo {
 
 // The path from the top of the tree on: where the tree lay when it was built is nothing for a log.
 inline const char* PathInTree(const char* szFile) {
+    size_t nTop = 0;
     for (const std::string_view szFolder : {"platform/linux/", "ground/"}) {
-        if (const size_t nAt = std::string_view(szFile).rfind(szFolder); nAt != std::string_view::npos) {
-            return szFile + nAt;
-        }
+        const size_t nAt = std::string_view(szFile).rfind(szFolder);
+        nTop = nAt == std::string_view::npos ? nTop : std::max(nTop, nAt);
     }
-    return szFile;
+    return szFile + nTop;
 }
 
 // Builtins, since the clang of Debian 12 has no std::source_location.

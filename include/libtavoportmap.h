@@ -107,6 +107,7 @@ TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_SUPPORT) == 4, "four bytes");
 TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_TASK) == 4, "four bytes");
 TAVO_LAYOUT(sizeof(__tag_TAVO_LIBTAVOPORTMAP_ERR) == 4, "four bytes");
 TAVO_LAYOUT(sizeof(__TAG_TAVO_ROUTER_INIT_STATE) == 4, "four bytes");
+TAVO_LAYOUT(sizeof(TAVO_ROUTER_STATUS) == 4, "four bytes");
 
 /* ---- records ------------------------------------------------------------------------------------ */
 

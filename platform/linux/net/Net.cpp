@@ -2,7 +2,6 @@
 // netlink) and the kernel's routing decision for a destination.
 // Promises: outputs untouched on failure; nothing is sent on the network.
 #include "tavo/net.h"
-#include "ground/Fail.h"
 
 #include <arpa/inet.h>
 #include <net/if.h>
@@ -18,6 +17,7 @@
 
 #include "ground/Border.h"
 #include "ground/Descriptor.h"
+#include "ground/Fail.h"
 #include "ground/net/Netlink.h"
 
 namespace {

@@ -3,7 +3,6 @@
 // Promises: a record changes whole or not at all; what nobody here can have written (another type, too
 // deep, too long) is no record; no name leads out of the directory; nothing is thrown.
 #include "tavo/task.h"
-#include "ground/Fail.h"
 
 #include <json/json.h>
 
@@ -12,6 +11,7 @@
 #include <sstream>
 
 #include "ground/Border.h"
+#include "ground/Fail.h"
 #include "ground/Paths.h"
 #include "ground/TextFile.h"
 
