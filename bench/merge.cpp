@@ -32,7 +32,7 @@ struct OneRule : OperationRules {
 // it finds, the others remove it. The lists are made outside the time.
 void ThreePasses(benchmark::State& state, Pass pfnPass) {
     const int nPorts = static_cast<int>(state.range(0));
-    for (auto _ : state) {
+    for ([[maybe_unused]] auto _ : state) {
         state.PauseTiming();
         {
             OneRule disabled(nPorts), request(nPorts), again(nPorts), user(nPorts);

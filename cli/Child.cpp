@@ -18,6 +18,7 @@ using Clock = std::chrono::steady_clock;
 
 pid_t Spawn(const std::vector<std::string>& rgszArguments, int fdOutput) {
     std::vector<char*> rgpArguments;
+    rgpArguments.reserve(rgszArguments.size() + 1);
     for (const std::string& szArgument : rgszArguments) {
         rgpArguments.push_back(const_cast<char*>(szArgument.c_str()));
     }

@@ -69,7 +69,7 @@ Reply UsedPorts() {
 
 void OfferText(CLI::App& diag, Request& request, const std::string& szName, const std::string& szArgument,
                const std::string& szExample, const std::string& szWhat,
-               std::function<Reply(const std::string&)> fnAnswer) {
+               const std::function<Reply(const std::string&)>& fnAnswer) {
     const auto pText = std::make_shared<std::string>();
     CLI::App* pCommand = AddCommand(diag, szName, szWhat);
     pCommand->add_option(szArgument, *pText, "such as " + szExample)->required();

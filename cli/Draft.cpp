@@ -263,7 +263,7 @@ Rules Rebase(const Rules& base, const Rules& edited, const Rules& current) {
 // ---- the draft ---------------------------------------------------------------------------------------------
 
 std::optional<Rules> LoadDraft() {
-    const auto inForce = LoadRules();
+    auto inForce = LoadRules();
     std::string szText;
     const ReadState enState = ReadOwnFile(kDraft, szText);
     if (!inForce || enState == ReadState::kAbsent) {

@@ -142,7 +142,7 @@ typedef struct __tag_TAVO_ROUTER_CONF {
     char szConnPort[TAVO_TEXT_SIZE];
     char szMaxRule[TAVO_TEXT_SIZE]; /* decimal; only ever read */
 } __tag_TAVO_ROUTER_CONF;
-TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_CONF) == 10 * 1024, "settings layout");
+TAVO_LAYOUT(sizeof(__tag_TAVO_ROUTER_CONF) == 10 * 1024UL, "settings layout");
 
 /* Outcome and progress of router detection. */
 typedef struct __tag_TAVO_ROUTER_DETECT_RESULT {
@@ -178,7 +178,7 @@ typedef struct __tag_TAVO_ROUTERDB_LIST {
     int blGeneric; /* 1: the description is not tied to a firmware version */
     struct __tag_TAVO_ROUTERDB_LIST* pNext;
 } __tag_TAVO_ROUTERDB_LIST;
-TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, blGeneric) == 3 * 1024, "list layout");
+TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, blGeneric) == 3 * 1024UL, "list layout");
 TAVO_LAYOUT(offsetof(__tag_TAVO_ROUTERDB_LIST, pNext) % sizeof(void*) == 0, "list layout");
 
 /* Progress and outcome of saving rules. Set nStatus to 0 before the call: the save never resets it. */

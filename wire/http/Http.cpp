@@ -122,8 +122,8 @@ void HttpClient::SetLimit(int nMilliseconds) {
     mPImpl->nLimitMilliseconds = std::clamp<long>(nMilliseconds, 1, mPImpl->nMostMilliseconds);
 }
 
-void HttpClient::SetStop(std::function<bool()> fnStop) {
-    mPImpl->fnStop = std::move(fnStop);
+void HttpClient::SetStop(const std::function<bool()>& fnStop) {
+    mPImpl->fnStop = fnStop;
 }
 
 HttpAnswer HttpClient::Get(const HttpUrl& url) {

@@ -54,7 +54,7 @@ public:
     // The most that one request may take from now on.
     virtual void SetLimit(int /*nMilliseconds*/) {}
     // Requests end, as timeouts, within a second of the moment from which fnStop answers true.
-    virtual void SetStop(std::function<bool()> /*fnStop*/) {}
+    virtual void SetStop(const std::function<bool()>& /*fnStop*/) {}
 };
 
 // The network. One client keeps its connection open between requests where the router does.
@@ -72,7 +72,7 @@ public:
     HttpAnswer Ask(const std::string& szMethod, const HttpUrl& url,
                    const std::vector<std::string>& rgszHeaders) override;
     void SetLimit(int nMilliseconds) override;
-    void SetStop(std::function<bool()> fnStop) override;
+    void SetStop(const std::function<bool()>& fnStop) override;
 
 private:
     void Prepare(const HttpUrl& url);
