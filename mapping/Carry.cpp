@@ -225,10 +225,10 @@ bool Carrier::Unrecorded(Place& place) {
 
 // Asks for what is wanted at a place. True: what is known of the place has changed, and is to be decided anew.
 bool Carrier::Add(Place& place, bool blAnew) {
+    // What was granted since, and is to be renewed, is there.
     const auto& mapElsewhere = mPlaces.habit.mapElsewhere;
-    if (const auto it = mapElsewhere.find(place.key); it != mapElsewhere.end()) {
+    if (const auto it = mapElsewhere.find(place.key); blAnew && it != mapElsewhere.end()) {
         place.verdict = RefusedBy({Reply::kElsewhere, it->second});
-        Forget(place);
         return false;
     }
     if (const uint16_t nOlder = OlderPlace(place); nOlder != 0) {
@@ -275,6 +275,7 @@ void Carrier::OnMade(Place& place, const RouterMapping& mapping, int64_t nAsked,
     if (blAnew) {
         mPlaces.around.fnTell(mapping, {Action::kAdd, place.szWhy});
     }
+    mPlaces.habit.mapElsewhere.erase(place.key);
     place.blWritten = true;
     if (mPlaces.what.blShows) {
         place.enSeen = Seen::kUnknown;
@@ -431,6 +432,10 @@ RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) 
 
 PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& habit,
                        const Surroundings& around) {
+    if (habit.router != record.Router()) {
+        habit.mapElsewhere.clear();
+        habit.router = record.Router();
+    }
     Places places(router, rgWanted, record, habit, around);
     return Carrier(places).Run(rgWanted);
 }

@@ -60,6 +60,9 @@ void NoteIntents(Places& places, const PlaceList& rgpPlaces) {
     for (Place* pPlace : rgpPlaces) {
         const Action enAction = places.StepFor(*pPlace).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
+            if (places.habit.mapElsewhere.contains(pPlace->key)) {
+                continue;  // it is not asked for now
+            }
             rgpAsked.push_back(pPlace);
         } else if (enAction == Action::kRenew && places.MadeAt(*pPlace) == nullptr) {  // made before there was a record
             places.rows[pPlace->key] = RowOf(pPlace->entry, true, 0);

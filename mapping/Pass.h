@@ -25,6 +25,7 @@ struct Habits {
     std::map<MappingKey, std::string> mapElsewhere = {};
     int64_t nElsewhereSince = 0;  // seconds of boot time: none of them is older
     MappingKey next = {};         // where to go on, after a pass that its time was too short for
+    RouterName router = {};       // that gave them: another one at the same address may have the places free
 };
 
 struct Surroundings {

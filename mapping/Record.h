@@ -28,6 +28,7 @@ struct RouterName {
     std::string szGateway;
     std::string szHardware;
 
+    bool operator==(const RouterName& other) const = default;
     bool IsSame(const RouterName& other) const {
         return szHardware.empty() || other.szHardware.empty() ? szGateway == other.szGateway
                                                               : szHardware == other.szHardware;
@@ -81,6 +82,7 @@ public:
 
     // The rows of one router, to be read and changed; those of the others wait.
     void TurnTo(const RouterName& router);
+    const RouterName& Router() const { return mRouter; }
     Rows& Here() { return mHere; }
     const Rows& Here() const { return mHere; }
 

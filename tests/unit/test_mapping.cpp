@@ -111,12 +111,14 @@ std::vector<std::string> Texts(const tavo::PassResult& result) {
 
 // The core with a memory of its own, at a time that only the test moves.
 struct Core {
-    tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted) {
-        record.TurnTo({"192.168.1.1", ""});
+    tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted,
+                         const std::string& szHardware = "") {
+        record.TurnTo({"192.168.1.1", szHardware});
         return tavo::BringInLine(
             router, rgWanted, record, habit,
-            {kBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0; }});
+            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0; }});
     }
+    std::string szBox = kBox;
     tavo::Record record{"", "boot"};
     tavo::Habits habit;
     int64_t nNow = 1000;
@@ -537,6 +539,101 @@ TEST(Mapping, ABlindRemovalEndsWithTheLease) {
         EXPECT_EQ(router.mMapTable.size(), nAge == 3600 ? 0U : 1U);
         EXPECT_TRUE(core.record.Here().empty());
     }
+}
+
+// One that shows nothing, knows a mapping by its client and the client's port, and where the wanted place is taken
+// gives the next one.
+class LendingRouter : public MemoryRouter {
+public:
+    tavo::Abilities What() const override { return {false, true, true}; }
+    RouterReply List(std::vector<RouterMapping>&) override { return {}; }
+    RouterReply Add(RouterMapping& mapping) override {
+        const uint16_t nWanted = mapping.nRouterPort;
+        if (const auto own = Find(mapping); own != mMapTable.end()) {
+            mapping.nRouterPort = own->first.second;
+        }
+        while (mMapTable.contains(tavo::KeyOf(mapping)) && Find(mapping) == mMapTable.end()) {
+            ++mapping.nRouterPort;
+        }
+        Put(mapping);
+        if (std::exchange(mBlLoseAdd, false)) {
+            return IgdReply(tavo::kWireTimeout);
+        }
+        return mapping.nRouterPort == nWanted
+                   ? RouterReply{}
+                   : RouterReply{tavo::Reply::kElsewhere, "offered " + std::to_string(mapping.nRouterPort)};
+    }
+    RouterReply Remove(const RouterMapping& mapping) override {
+        if (mapping.szClient != mSzClient) {
+            return {tavo::Reply::kRefused, "former"};
+        }
+        if (std::exchange(mBlLoseRemove, false)) {
+            return IgdReply(tavo::kWireTimeout);
+        }
+        if (const auto own = Find(mapping); own != mMapTable.end()) {
+            mMapTable.erase(own);
+        }
+        return {};
+    }
+    // Router ports, with where they lead to.
+    std::string Table() const {
+        std::string szTable;
+        for (const auto& [key, mapping] : mMapTable) {
+            szTable += std::to_string(key.second) + "-" + mapping.szClient.substr(10) + ":" +
+                       std::to_string(mapping.nBoxPort) + " ";
+        }
+        return szTable;
+    }
+
+    std::string mSzClient = kBox;
+    bool mBlLoseAdd = false;  // the answer to the next one
+    bool mBlLoseRemove = false;
+
+private:
+    std::map<std::pair<std::string, uint16_t>, RouterMapping>::iterator Find(const RouterMapping& mapping) {
+        return std::find_if(mMapTable.begin(), mMapTable.end(), [&](const auto& row) {
+            return row.second.szClient == mapping.szClient && row.second.nBoxPort == mapping.nBoxPort;
+        });
+    }
+};
+
+using Rows = std::vector<std::string>;
+
+// Two routers at one address: where the one had another place to give, the other has lent the place that was asked for.
+TEST(Mapping, WhatOneRouterGaveElsewhereSaysNothingOfAnother) {
+    LendingRouter first;
+    LendingRouter other;
+    first.Put(Entry(6, 1, "192.168.1.9", "game"));
+    Core core;
+    const std::vector<RouterMapping> rgWanted = {Entry(6, 3, "", "tavo:a")};
+    EXPECT_EQ(Texts(core.Run(other, rgWanted, "bb")), Rows{"6/tcp 1 anew"});
+    EXPECT_EQ(Texts(core.Run(first, rgWanted, "aa")), Rows{"6/tcp offered 7"});
+    core.nSaves = 0;
+    EXPECT_EQ(Texts(core.Run(first, rgWanted, "aa")), Rows{"6/tcp offered 7"});
+    EXPECT_EQ(core.nSaves, 2) << "nothing is asked for, and nothing put on record";
+    core.nNow += core.habit.nLease / 2;
+    EXPECT_EQ(Texts(core.Run(other, rgWanted, "bb")), Rows{"6/tcp 1"});
+    EXPECT_EQ(Texts(core.Run(other, {Entry(9, 4, "", "tavo:b")}, "bb")), Rows{"9/tcp 1 anew"});
+    EXPECT_EQ(other.Table(), "9-5:4 ");
+}
+
+// A place that was once given elsewhere, and by now was given instead of another one.
+TEST(Mapping, WhatWasGrantedSinceIsRenewed) {
+    LendingRouter router;
+    router.Put(Entry(5, 1, "192.168.1.9", "game"));
+    router.Put(Entry(6, 1, "192.168.1.9", "game"));
+    Core core;
+    const std::vector<RouterMapping> rgWanted = {Entry(6, 3, "", "tavo:a")};
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp offered 7"});
+    router.mMapTable.erase({"TCP", 6});
+    router.mBlLoseRemove = true;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(5, 3, "", "tavo:b")})),
+              (Rows{"5/tcp offered 6", "6/tcp timeout left over"}));
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp 1"});
+    core.nNow += core.habit.nLease / 2;
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp 1"});
+    core.Run(router, {});
+    EXPECT_EQ(router.Table(), "5-9:1 ");
 }
 
 // Often after a change, seldom in peace; a router that fails is looked for anew at every third time.
