@@ -52,6 +52,14 @@ Step WantedAndThere(const PlaceView& view, const std::string& szBox, int64_t nNo
     return blDue ? Step{Action::kRenew, "half of its lease is over"} : Step{Action::kKeep, "as it is to be"};
 }
 
+// Whether what was asked for here before may be there and lead elsewhere. A router that knows a mapping by the port of
+// the box puts the new one beside it, and our record of the place would be of the new one only.
+bool MayHoldAnother(const PlaceView& view, const std::string& szBox, int64_t nNow, const Abilities& what) {
+    return what.blByBoxPort && view.pMade != nullptr && !view.pMade->blShown &&
+           !view.pMade->IsSurelyOver(nNow, what.blLeases) &&
+           !Serves(MappingOf(KeyOf(*view.pWanted), *view.pMade, 0), *view.pWanted, szBox);
+}
+
 }  // namespace
 
 bool IsOurs(const RouterMapping& entry, const Made* pMade, const std::string& szBox) {
@@ -76,6 +84,9 @@ Step Decide(const PlaceView& view, const std::string& szBox, int64_t nNow, const
         case Seen::kHidden:
             if (what.blForm && view.pMade != nullptr) {
                 return {Action::kReplace, "made anew: the answer shows whether it is there"};
+            }
+            if (MayHoldAnother(view, szBox, nNow, what)) {
+                return {Action::kReplace, "what was asked for here before may be there, and leads elsewhere"};
             }
             [[fallthrough]];
         default:

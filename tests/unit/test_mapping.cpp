@@ -636,6 +636,23 @@ TEST(Mapping, WhatWasGrantedSinceIsRenewed) {
     EXPECT_EQ(router.Table(), "5-9:1 ");
 }
 
+// An answer was lost, and the place is to lead elsewhere by now: what may be there is known until it is gone.
+TEST(Mapping, WhatMayHaveBeenLentIsTakenAwayBeforeItsPlaceIsUsedAnew) {
+    LendingRouter router;
+    router.mBlLoseAdd = true;
+    Core core;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(6, 3, "", "tavo:a")})), Rows{"6/tcp timeout"});
+    EXPECT_EQ(Texts(core.Run(router, {Entry(6, 4, "", "tavo:a")})), Rows{"6/tcp 1 anew"});
+    EXPECT_EQ(router.Table(), "6-5:4 ");
+
+    router.mBlLoseAdd = true;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:a")})), Rows{"7/tcp timeout"});
+    core.szBox = router.mSzClient = "192.168.1.6";
+    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:a")})), Rows{"7/tcp former"});
+    EXPECT_EQ(Texts(core.Run(router, {})), Rows{"7/tcp former left over"});
+    EXPECT_EQ(router.Table(), "7-5:3 ");
+}
+
 // Often after a change, seldom in peace; a router that fails is looked for anew at every third time.
 TEST(Keeper, LooksSoonAfterAChangeAndSeldomInPeace) {
     struct Pass {
