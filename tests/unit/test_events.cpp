@@ -14,6 +14,8 @@
 #include <vector>
 
 #include "ground/Descriptor.h"
+#include "webserver.h"
+#include "wire/http/Request.h"
 #include "wire/upnp/Events.h"
 
 namespace {
@@ -164,6 +166,23 @@ TEST_F(EventsTest, ASubscriptionIsKeptAndEnded) {
     EXPECT_EQ(mPRouter->TakeAsked(), Asked());
 }
 
+TEST_F(EventsTest, ATermIsHalvedAndBounded) {
+    const std::pair<const char*, std::chrono::seconds> rgCases[] = {
+        {"Second-1", 30s},     {"Second-61", 30s},     {"Second-62", 31s}, {"SECOND-120", 60s}, {"Second-1799", 899s},
+        {"Second-1801", 900s}, {"Second-99999", 900s}, {"Second-", 900s},  {"Second-x", 900s},  {"Minute-120", 900s}};
+    for (const auto& [szTerm, half] : rgCases) {
+        mPRouter->Grant({"SID: uuid:1", std::string("TIMEOUT: ") + szTerm});
+        mEvents.TurnTo(kService, kRouter);
+        mEvents.Keep(mNow, {});
+        mPRouter->TakeAsked();
+        mEvents.Keep(mNow + half - 1s, {});
+        EXPECT_EQ(mPRouter->TakeAsked().size(), 0U) << szTerm;
+        mPRouter->Grant({});
+        mEvents.Keep(mNow + half + 1s, {});
+        EXPECT_EQ(mPRouter->TakeAsked().size(), 1U) << szTerm;
+    }
+}
+
 TEST_F(EventsTest, ARouterThatWillNotIsLeftAloneForAWhile) {
     const auto fnAsk = [this](const char* szWhat) {
         mEvents.TurnTo(kService, kRouter);
@@ -178,16 +197,19 @@ TEST_F(EventsTest, ARouterThatWillNotIsLeftAloneForAWhile) {
     fnAsk("refused");
     mPRouter->Grant({"TIMEOUT: Second-1800"});
     fnAsk("no name");
-    mPRouter->Grant({"SID: " + std::string(300, 'x')});
+    mPRouter->Grant({"SID: " + std::string(257, 'x')});
     fnAsk("a name without end");
     fnAsk("silent");
-    mPRouter->Grant({"SID: uuid:9"});
-    mEvents.Keep(mNow + 11min, {});
+    mPRouter->Grant({"SID: " + std::string(256, 'x')});
+    mEvents.Keep(mNow + 10min - 1s, {});
+    EXPECT_FALSE(mEvents.IsSubscribed());
+    mEvents.Keep(mNow + 10min, {});
     EXPECT_TRUE(mEvents.IsSubscribed());
 }
 
 TEST_F(EventsTest, NewsIsWhatNamesOurTableAndWhatCountsAnew) {
     Subscribe();
+    const std::string szLong = std::string(7500, 'x') + kCount;
     struct Case {
         const char* szWhat;
         uint32_t nNumber;
@@ -205,7 +227,8 @@ TEST_F(EventsTest, NewsIsWhatNamesOurTableAndWhatCountsAnew) {
                             {"it counts anew", 0, kState, true},
                             {"it goes on again", 1, kState, false},
                             {"the last number", UINT32_MAX, kState, true},
-                            {"after which comes 1", 1, kState, false}};
+                            {"after which comes 1", 1, kState, false},
+                            {"a long one", 2, szLong.c_str(), true}};
     for (const Case& one : rgCases) {
         std::string szAnswer;
         EXPECT_EQ(IsNews(Notice(one.nNumber, one.szBody), &szAnswer), one.blNews) << one.szWhat;
@@ -271,51 +294,6 @@ TEST_F(EventsTest, SlowOnesHoldNobodyUp) {
     EXPECT_EQ(Answer(fd), kOk);
 }
 
-// One request, read to the end of its headers, and its answer; the connection stays open until the next one or the end.
-class WebServer {
-public:
-    explicit WebServer(std::string szAnswer) : mSzAnswer(std::move(szAnswer)) {
-        sockaddr_in own = {};
-        own.sin_family = AF_INET;
-        inet_pton(AF_INET, kRouter, &own.sin_addr);
-        socklen_t nLength = sizeof(own);
-        EXPECT_EQ(bind(mFd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength), 0);
-        EXPECT_EQ(listen(mFd.Get(), 1), 0);
-        EXPECT_EQ(getsockname(mFd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength), 0);
-        mNPort = ntohs(own.sin_port);
-        mThread = std::thread([this] { Serve(); });
-    }
-    ~WebServer() { Request(); }
-    int Port() const { return mNPort; }
-    std::string Request() {
-        if (mThread.joinable()) {
-            mThread.join();
-        }
-        return mSzRequest;
-    }
-
-private:
-    void Serve() {
-        mFdClient.Reset(accept(mFd.Get(), nullptr, nullptr));
-        char szText[1000];
-        while (mSzRequest.find("\r\n\r\n") == std::string::npos) {
-            const ssize_t nRead = recv(mFdClient.Get(), szText, sizeof(szText), 0);
-            if (nRead <= 0) {
-                return;
-            }
-            mSzRequest.append(szText, static_cast<size_t>(nRead));
-        }
-        send(mFdClient.Get(), mSzAnswer.data(), mSzAnswer.size(), MSG_NOSIGNAL);
-    }
-
-    std::string mSzAnswer;
-    std::string mSzRequest;
-    int mNPort = 0;
-    tavo::Descriptor mFd{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
-    tavo::Descriptor mFdClient;
-    std::thread mThread;
-};
-
 TEST(HttpClient, AsksByAnyMethodAndReadsTheHeaders) {
     WebServer server("HTTP/1.1 200 OK\r\nSID:  uuid:1 \r\nTimeout: Second-7\r\n\r\n");  // and no end of the body
     const auto start = std::chrono::steady_clock::now();
@@ -330,13 +308,162 @@ TEST(HttpClient, AsksByAnyMethodAndReadsTheHeaders) {
     EXPECT_NE(server.Request().find("\r\nNT: upnp:event\r\n"), std::string::npos);
 }
 
-TEST(HttpClient, HeadersWithoutEndAreGarbage) {
-    std::string szAnswer = "HTTP/1.1 200 OK\r\n";
-    for (int i = 0; i < 2000; ++i) {
-        szAnswer += "Set-Cookie: " + std::string(30, 'x') + "\r\n";
+// A head of so many bytes, its end included.
+std::string HeadOf(size_t nSize, const std::string& szFirst) {
+    std::string szHead = szFirst + "\r\n";
+    while (szHead.size() + 2 < nSize) {
+        const size_t nLine = std::min<size_t>(nSize - 2 - szHead.size(), 1000);
+        const size_t nRest = nSize - 2 - szHead.size() - nLine;
+        szHead += "A: " + std::string(nLine - 5 - (nRest > 0 && nRest < 10 ? 10 : 0), 'x') + "\r\n";
     }
-    WebServer server(szAnswer);
-    EXPECT_EQ(tavo::HttpClient().Get({kRouter, server.Port(), "/"}).enEnd, HttpEnd::kGarbage);
+    return szHead + "\r\n";
+}
+
+TEST(HttpClient, EndsInTimeAndTakesNoMoreThanItsBounds) {
+    const std::string szOk = "HTTP/1.1 200 OK";
+    const auto fnBody = [&](size_t nSize) {
+        return szOk + "\r\nContent-Length: " + std::to_string(nSize) + "\r\n\r\n" + std::string(nSize, 'x');
+    };
+    const std::string szEmpty = szOk + "\r\nContent-Length: 0";
+    struct Case {
+        const char* szWhat;
+        std::string szAnswer;
+        HttpEnd enEnd;
+        int nMost = 5000;
+        int nLimit = 5000;
+        int nTakes = 0;  // milliseconds, at least
+        bool blStop = false;
+    };
+    const Case rgCases[] = {{"the longest body", fnBody(256U << 10U), HttpEnd::kAnswered},
+                            {"a longer one", fnBody((256U << 10U) + 1), HttpEnd::kGarbage},
+                            {"the longest head", HeadOf(32U << 10U, szEmpty), HttpEnd::kAnswered},
+                            {"a longer one", HeadOf((32U << 10U) + 1, szEmpty), HttpEnd::kGarbage},
+                            {"no HTTP", "hello\r\n\r\n", HttpEnd::kGarbage},
+                            {"silence", "", HttpEnd::kTimeout, 5000, 300, 290},
+                            {"silence, and a limit beyond the client's own", "", HttpEnd::kTimeout, 300, 5000, 290},
+                            {"no time at all", "", HttpEnd::kTimeout, 5000, 0},
+                            {"a stop", "", HttpEnd::kTimeout, 5000, 5000, 0, true}};
+    for (const Case& one : rgCases) {
+        WebServer server(one.szAnswer);
+        tavo::HttpClient client(one.nMost);
+        client.SetLimit(one.nLimit);
+        const auto start = std::chrono::steady_clock::now();
+        client.SetStop([&] { return one.blStop && std::chrono::steady_clock::now() - start > 100ms; });
+        const tavo::HttpAnswer answer = client.Get({kRouter, server.Port(), "/"});
+        const auto took = std::chrono::steady_clock::now() - start;
+        EXPECT_EQ(answer.enEnd, one.enEnd) << one.szWhat;
+        EXPECT_TRUE(took >= one.nTakes * 1ms && took < 2500ms) << one.szWhat << " " << took / 1ms;
+        EXPECT_TRUE(one.enEnd != HttpEnd::kAnswered || answer.nCode == 200) << one.szWhat;
+        if (one.nLimit == 0) {  // it may have ended before it was connected
+            tavo::HttpClient().Get({kRouter, server.Port(), "/"});
+        }
+    }
+    EXPECT_EQ(tavo::HttpClient().Get({kRouter, 1, "/"}).enEnd, HttpEnd::kUnreachable);
+}
+
+TEST(HttpUrl, IsOfOneHostAndOnePort) {
+    const std::pair<const char*, const char*> rgCases[] = {{"http://h/", "http://h:80/"},
+                                                           {"http://h:1/a?b=c", "http://h:1/a?b=c"},
+                                                           {"http://h:65535", "http://h:65535/"},
+                                                           {"https://h/a", "https://h:443/a"},
+                                                           {"ftp://h/", ""},
+                                                           {"http://u@h/", ""},
+                                                           {"http://h:0/", ""},
+                                                           {"http://h:65536/", ""},
+                                                           {"nonsense://", ""}};
+    for (const auto& [szUrl, szRead] : rgCases) {
+        const auto url = tavo::ParseHttpUrl(szUrl, true);
+        EXPECT_EQ(url ? url->Text() : "", szRead) << szUrl;
+    }
+    EXPECT_FALSE(tavo::ParseHttpUrl("https://h/"));
+}
+
+// Of what has come so far, and over a socket whose other side says no more.
+TEST(HttpRequest, IsWholeAndPlainOrItIsNone) {
+    using tavo::HttpFault;
+    const auto fnHeaders = [](int nMore) {
+        std::string szText = "POST /p HTTP/1.1\r\nContent-Length: 0\r\n";
+        for (int i = 0; i < nMore; ++i) {
+            szText += "A: b\r\n";
+        }
+        return szText + "\r\n";
+    };
+    const auto fnLength = [](const std::string& szLength, const std::string& szBody = "") {
+        return "POST /p HTTP/1.1\r\nContent-Length:" + szLength + "\r\n\r\n" + szBody;
+    };
+    const std::string szLongest(24U << 10U, 'x');
+    const std::tuple<const char*, std::string, HttpFault> rgCases[] = {
+        {"plain", "POST /p HTTP/1.1\r\nContent-Length: 2 \r\n\r\nab", HttpFault::kNone},
+        {"the older version", "POST /p HTTP/1.0\r\ncontent-length:2\r\n\r\nabc", HttpFault::kNone},
+        {"a later version", "POST /p HTTP/1.2\r\nContent-Length: 2\r\n\r\nab", HttpFault::kNoRequest},
+        {"no version", "POST /p\r\nContent-Length: 2\r\n\r\nab", HttpFault::kNoRequest},
+        {"no method", " /p HTTP/1.1\r\nContent-Length: 2\r\n\r\nab", HttpFault::kNoRequest},
+        {"a blank before the colon", "POST /p HTTP/1.1\r\nContent-Length : 2\r\n\r\nab", HttpFault::kNoRequest},
+        {"a line that goes on", "POST /p HTTP/1.1\r\nContent-Length: 2\r\n A: b\r\n\r\nab", HttpFault::kNoRequest},
+        {"a header without name", "POST /p HTTP/1.1\r\n: 2\r\n\r\n", HttpFault::kNoRequest},
+        {"40 headers", fnHeaders(39), HttpFault::kNone},
+        {"41 headers", fnHeaders(40), HttpFault::kTooManyHeaders},
+        {"the longest body", fnLength("24576", szLongest), HttpFault::kNone},
+        {"a longer one", fnLength("24577", szLongest + "x"), HttpFault::kTooLong},
+        {"more than there are numbers for", fnLength("99999999999999999999"), HttpFault::kTooLong},
+        {"less than nothing", fnLength("-1"), HttpFault::kNoLength},
+        {"no number", fnLength("1x", "a"), HttpFault::kNoLength},
+        {"an empty length", fnLength(""), HttpFault::kNoLength},
+        {"no length", "POST /p HTTP/1.1\r\n\r\n", HttpFault::kNoLength},
+        {"an encoding", fnLength("1\r\nTransfer-Encoding: chunked", "a"), HttpFault::kNoLength},
+        {"a body cut short", fnLength("2", "a"), HttpFault::kGone},
+        {"a head cut short", "POST /p HTTP/1.1\r\nContent-Length: 0\r\n\r", HttpFault::kGone}};
+    for (const auto& [szWhat, szText, enFault] : rgCases) {
+        tavo::HttpRequest whole;
+        EXPECT_EQ(whole.Parse(szText), enFault) << szWhat;
+        int rgFds[2] = {};
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds), 0);
+        const tavo::Descriptor fdHere(rgFds[0]), fdThere(rgFds[1]);
+        send(fdThere.Get(), szText.data(), szText.size(), 0);
+        shutdown(fdThere.Get(), SHUT_WR);
+        tavo::BoundedSocket bounded(fdHere.Get(), -1);
+        tavo::HttpRequest read;
+        const HttpFault enHead = read.ReadHead(bounded);
+        EXPECT_EQ(enHead == HttpFault::kNone ? read.ReadBody(bounded) : enHead, enFault) << szWhat;
+        if (enFault == HttpFault::kNone) {
+            for (const tavo::HttpRequest& request : {whole, read}) {
+                EXPECT_EQ(request.Method() + request.Path(), "POST/p") << szWhat;
+                EXPECT_EQ(std::to_string(request.Body().size()), request.Header("CONTENT-LENGTH")) << szWhat;
+            }
+        }
+    }
+}
+
+TEST(HttpRequest, IsReadToABoundAndToAStop) {
+    const std::string szFirst = "POST /p HTTP/1.1\r\nExpect: 100-Continue\r\nContent-Length: 1";
+    for (const auto& [szText, blStop, blRead] :
+         {std::tuple(HeadOf(32767, szFirst) + "x", false, true), std::tuple(HeadOf(32768, szFirst) + "x", false, false),
+          std::tuple(std::string(), true, false)}) {
+        int rgFds[2] = {};
+        int rgStop[2] = {};
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds) + pipe(rgStop), 0);
+        const tavo::Descriptor fdHere(rgFds[0]), fdThere(rgFds[1]), fdStop(rgStop[0]);
+        tavo::Descriptor fdStopper(rgStop[1]);
+        send(fdThere.Get(), szText.data(), szText.size() - (blRead ? 1 : 0), 0);
+        if (blStop) {
+            fdStopper.Reset();
+        }
+        tavo::BoundedSocket bounded(fdHere.Get(), fdStop.Get());
+        tavo::HttpRequest request;
+        const auto start = std::chrono::steady_clock::now();
+        EXPECT_EQ(request.ReadHead(bounded) == tavo::HttpFault::kNone, !blStop);
+        if (!blStop) {
+            std::thread late([&, fd = fdThere.Get()] {
+                char szTold[100] = {};
+                EXPECT_TRUE(!blRead || recv(fd, szTold, sizeof(szTold), 0) > 0);
+                EXPECT_EQ(std::string(szTold), blRead ? "HTTP/1.1 100 Continue\r\n\r\n" : "");
+                send(fd, "x", blRead ? 1 : 0, 0);
+            });
+            EXPECT_EQ(request.ReadBody(bounded) == tavo::HttpFault::kNone, blRead);
+            late.join();
+        }
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 1s);
+    }
 }
 
 }  // namespace

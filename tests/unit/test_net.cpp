@@ -1,11 +1,15 @@
-// The network checks: what addresses tell, and that each check ends where nothing answers.
+// The network checks: what addresses tell, that each check ends where nothing answers, and what the kernel tells.
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
 
 #include <chrono>
 
 #include "ground/net/Level.h"
+#include "ground/net/Neighbour.h"
+#include "ground/net/NetworkWatch.h"
+#include "tavo/core.h"
 #include "tavo/net.h"
+#include "wire/icmp/HopProbe.h"
 #include "world.h"
 
 namespace {
@@ -108,6 +112,70 @@ TEST(NetworkChecks, FailAtOnceInABoxWithoutANetwork) {
     EXPECT_EQ(getPublicIPLevel(nLevel, 3), -1);
     std::filesystem::remove("/etc/tavo/platform.conf");
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(7));
+}
+
+TEST(HopProbe, ShowsTheHostItselfAtEveryDistanceAndKeepsItsBounds) {
+    const std::tuple<int, int, size_t> rgCases[] = {{1, 1, 1}, {1, 3, 3}, {30, 30, 1}, {29, 31, 2},
+                                                    {0, 3, 0}, {3, 2, 0}, {31, 31, 0}};
+    for (const auto& [nFirst, nLast, nSteps] : rgCases) {
+        const auto start = std::chrono::steady_clock::now();
+        const auto rgFound = tavo::WalkTowards(Address("127.0.0.1"), nFirst, nLast, 1000);
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(500)) << "all have answered";
+        EXPECT_EQ(rgFound.size(), nSteps) << nFirst << "-" << nLast;
+        for (const auto& who : rgFound) {
+            EXPECT_TRUE(who && who->s_addr == Address("127.0.0.1").s_addr) << nFirst << "-" << nLast;
+        }
+    }
+}
+
+TEST(NetworkWatch, SaysThatSomethingHasChangedAndThenNoMore) {
+    tavo::NetworkWatch watch;
+    ASSERT_GE(watch.Fd(), 0);
+    for (const char* szChange : {"ip address add 192.168.77.1/24 dev lo", "ip address del 192.168.77.1/24 dev lo",
+                                 "ip link add v0 type veth peer name v1", "ip link del v0"}) {
+        EXPECT_FALSE(watch.TakeChange());
+        ASSERT_EQ(TLIBCSystem(szChange), 0) << szChange;
+        EXPECT_TRUE(watch.TakeChange()) << szChange;
+    }
+    EXPECT_FALSE(watch.TakeChange());
+}
+
+// The other end of the link takes what it is asked and does not answer.
+TEST(Neighbour, IsThereUntilTheKernelKnowsBetter) {
+    for (const char* szStep :
+         {"ip link add v0 type veth peer name v1", "ip link set v1 up", "ip address add 10.77.0.1/24 dev v0",
+          "ip link set v0 up", "ip neigh add 10.77.0.2 lladdr 00:11:22:aa:bb:cc dev v0",
+          "echo 100 >/proc/sys/net/ipv4/neigh/v0/retrans_time_ms"}) {
+        ASSERT_EQ(TLIBCSystem(szStep), 0) << szStep;
+    }
+    const std::pair<const char*, const char*> rgAddresses[] = {
+        {"10.77.0.2", "00:11:22:aa:bb:cc"}, {"10.77.0.3", ""}, {"127.0.0.1", ""}, {"10.77.0", ""}, {"", ""}};
+    for (const auto& [szAddress, szHardware] : rgAddresses) {
+        EXPECT_EQ(tavo::HardwareAddress(szAddress), szHardware) << szAddress;
+    }
+    struct Case {
+        const char* szWhat;
+        const char* szAddress;
+        int nState;  // of the kernel's row, NUD_STALE or none
+        bool blStop;
+        bool blThere;
+    };
+    const Case rgCases[] = {
+        {"known for good", "10.77.0.2", 0, false, true}, {"nobody", "10.77.0.3", 0, false, false},
+        {"gone since", "10.77.0.4", 4, false, false},    {"nobody, and no time to ask", "10.77.0.5", 0, true, true},
+        {"this box", "127.0.0.1", 0, false, true},       {"no address", "10.77.0", 0, false, true}};
+    for (const Case& one : rgCases) {
+        if (one.nState != 0) {
+            ASSERT_EQ(
+                TLIBCSystem(
+                    (std::string("ip neigh add lladdr 00:11:22:aa:bb:cd nud stale dev v0 ") + one.szAddress).c_str()),
+                0);
+        }
+        const auto start = std::chrono::steady_clock::now();
+        EXPECT_EQ(tavo::IsNeighbourThere(one.szAddress, [&] { return one.blStop; }), one.blThere) << one.szWhat;
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(3)) << one.szWhat;
+    }
+    EXPECT_EQ(TLIBCSystem("ip link del v0"), 0);
 }
 
 }  // namespace

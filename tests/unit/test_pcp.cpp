@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "ground/Descriptor.h"
+#include "wire/pcp/Announcements.h"
 #include "wire/pcp/Client.h"
 #include "wire/pcp/Exchange.h"
 
@@ -64,7 +65,13 @@ TEST(NatpmpPacket, OnlyWhatAnswersTheQuestionCounts) {
         {"refused", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0x13, 0x89, 0, 0, 0, 0, 0, 0}, kRefused},
         {"refused, the port left empty", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0, 0, 0, 0, 0, 0, 0, 0}, kRefused},
         {"refused, the port left out", kMapping, {0, 130, 0, 2, 0, 0, 1, 2}, kRefused},
-        {"another port refused", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0x13, 0x88, 0, 0, 0, 0, 0, 0}, kNone}};
+        {"another port refused", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0x13, 0x88, 0, 0, 0, 0, 0, 0}, kNone},
+        {"the same, cut behind the ports", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0x13, 0x88, 0, 0}, kNone},
+        {"cut within them", kMapping, {0, 130, 0, 2, 0, 0, 1, 2, 0x13, 0x88, 0}, kRefused},
+        {"an address refused, with one that is no port of ours",
+         kAddress,
+         {0, 128, 0, 3, 0, 0, 1, 2, 198, 41, 0, 4},
+         kRefused}};
     for (const Case& one : rgCases) {
         const auto answer = tavo::ReadAnswer(one.rgDatagram, one.question);
         ASSERT_EQ(answer.has_value(), one.enKind != kNone) << one.szWhat;
@@ -254,8 +261,50 @@ TEST(NatpmpClient, WhetherAGatewaySpeaksIt) {
         const tavo::NatPmpWord word = tavo::AskNatPmp(kGateway);
         EXPECT_EQ(word.nCode.value_or(-1), one.nCode) << one.szWhat;
         EXPECT_EQ(word.address.has_value(), one.blAddress) << one.szWhat;
-        EXPECT_LT(Clock::now() - start, 1s) << one.szWhat;
+        const auto took = Clock::now() - start;
+        EXPECT_TRUE(took < 1s && (!one.rgSaid.empty() || took >= 740ms)) << one.szWhat << " " << took / 1ms;
     }
+}
+
+// What is said to all hosts, by whom: the gateway's word counts, as often as it comes, and nobody else's.
+TEST(GatewayAnnouncements, AreTheGatewaysOwn) {
+    tavo::GatewayAnnouncements announcements;
+    ASSERT_GE(announcements.Fd(), 0);
+    sockaddr_in all = {};
+    all.sin_family = AF_INET;
+    all.sin_port = htons(5350);
+    all.sin_addr.s_addr = htonl(INADDR_ALLHOSTS_GROUP);
+    in_addr loopback = {htonl(INADDR_LOOPBACK)};
+    const Bytes rgStarted{0, 128, 0, 0, 0, 0, 0, 7, 198, 41, 0, 4};
+    const Bytes rgGarbage{0, 128};
+    for (const auto& [szFrom, rgSaid] :
+         {std::pair(kNeighbour, rgStarted), {kGateway, rgGarbage}, {kGateway, rgStarted}, {kGateway, rgStarted}}) {
+        const tavo::Descriptor fd = SocketAt(szFrom);
+        setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &loopback, sizeof(loopback));
+        EXPECT_EQ(
+            sendto(fd.Get(), rgSaid.data(), rgSaid.size(), 0, reinterpret_cast<const sockaddr*>(&all), sizeof(all)),
+            static_cast<ssize_t>(rgSaid.size()));
+    }
+    const auto rgHeard = announcements.Take(kGateway);
+    ASSERT_EQ(rgHeard.size(), 2U);
+    EXPECT_EQ(std::pair(rgHeard[0].blPcp, rgHeard[0].nEpoch), std::pair(false, 7U));
+    EXPECT_TRUE(announcements.Take(kGateway).empty());
+}
+
+TEST(NatpmpClient, AsksForWhatItIsToldTo) {
+    {
+        const Peer peer([](int) {
+            return std::vector<Bytes>{{0, 130, 0, 0, 0, 0, 0, 9, 0x13, 0x89, 0x13, 0x8A, 0, 0, 0, 60}};
+        });
+        tavo::NatpmpGrant grant;
+        EXPECT_EQ(tavo::NatpmpClient(kGateway, {}, {}, 300ms).Map("TCP", 0x1389, 0x1388, 3600, grant), tavo::kWireOk);
+        EXPECT_EQ(std::pair(grant.nRouterPort, grant.nLifetime), std::pair(uint16_t{0x138A}, 60U));
+        EXPECT_EQ(tavo::NatpmpClient(kGateway, {}, {}, 300ms).Map("UDP", 0x1389, 0x1388, 3600, grant),
+                  tavo::kWireGarbage);
+    }
+    const Peer peer([](int) { return std::vector<Bytes>{{0, 129, 0, 0, 0, 0, 0, 9, 0x13, 0x89, 0, 0, 0, 0, 0, 0}}; });
+    EXPECT_EQ(tavo::NatpmpClient(kGateway, {}, {}, 300ms).Unmap("UDP", 0x1389), tavo::kWireOk);
+    EXPECT_EQ(tavo::NatpmpClient("no address", {}, {}, 300ms).Unmap("UDP", 0x1389), tavo::kWireUnreachable);
 }
 
 }  // namespace

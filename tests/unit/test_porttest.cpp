@@ -7,6 +7,7 @@
 #include "porttest/RuleVerdict.h"
 #include "programs/tavoportcheckd/Limits.h"
 #include "tavo/porttest.h"
+#include "webserver.h"
 #include "wire/portcheck/Checker.h"
 #include "world.h"
 
@@ -110,6 +111,63 @@ TEST(Checker, OnlyAWholeAndFittingAnswerIsOne) {
         const tavo::CheckerAnswer answer = tavo::ReadCheckerAnswer(szBody, rgPorts);
         EXPECT_TRUE(answer.rgFindings.empty() && !answer.szReason.empty()) << szBody.substr(0, 200);
     }
+}
+
+TEST(Checker, SettingsThatMakeNoSenseAreTheDefaults) {
+    const std::tuple<const char*, size_t, size_t> rgCases[] = {
+        {"", 64, 256},  {"1", 1, 1},     {"1024", 1024, 1024}, {"1025", 1024, 1024},
+        {"0", 64, 256}, {"-1", 64, 256}, {"7x", 64, 256},      {"x", 64, 256}};
+    for (const auto& [szNumber, nPerRequest, nMost] : rgCases) {
+        Write("/etc/tavo/platform.conf", std::string("[portcheck]\nurl=http://h\ntoken=t\nports_per_request=\"") +
+                                             szNumber + "\"\nmax_ports=\"" + szNumber + "\"\n");
+        const tavo::CheckerSettings settings = tavo::ReadCheckerSettings();
+        EXPECT_EQ(std::pair(settings.nPortsPerRequest, settings.nMaxPorts), std::pair(nPerRequest, nMost)) << szNumber;
+        EXPECT_EQ(settings.szUrl + settings.szToken, "http://ht");
+    }
+    std::filesystem::remove("/etc/tavo/platform.conf");
+    const std::string szNonce = tavo::MakeNonce();
+    EXPECT_TRUE(szNonce.size() == 32 && szNonce.find_first_not_of("0123456789abcdef") == szNonce.npos) << szNonce;
+    EXPECT_NE(szNonce, tavo::MakeNonce());
+}
+
+TEST(Checker, IsAskedAndItsAnswerReadOrTheReasonGiven) {
+    const std::string szBody = R"({"version":1,"address":"203.0.113.2","results":[)"
+                               R"({"protocol":"tcp","port":80,"state":"open","answered":true,"source":65535}]})";
+    const auto fnAnswer = [&](int nCode) {
+        return "HTTP/1.1 " + std::to_string(nCode) + " x\r\nContent-Length: " + std::to_string(szBody.size()) +
+               "\r\n\r\n" + szBody;
+    };
+    const std::tuple<std::string, const char*, int, const char*> rgCases[] = {
+        {fnAnswer(200), "t", 1, ""},
+        {fnAnswer(401), "t", 0, "does not accept the token"},
+        {fnAnswer(403), "t", 0, "does not accept the token"},
+        {fnAnswer(429), "t", 0, "is busy"},
+        {fnAnswer(503), "t", 0, "is busy"},
+        {fnAnswer(500), "t", 0, "(HTTP 500)"},
+        {fnAnswer(201), "t", 0, "(HTTP 201)"},
+        {"hello\r\n", "t", 0, "did not answer as one"},
+        {"", "t", 0, "did not answer in time"},
+        {"", "t\n", 0, "url or token cannot be used"},
+        {"", "t x", 0, "url or token cannot be used"}};
+    for (const auto& [szAnswer, szToken, nFindings, szReason] : rgCases) {
+        WebServer server(szAnswer);
+        tavo::Checker checker({"http://127.0.0.1:" + std::to_string(server.Port()) + "/base/", szToken, 1, 1});
+        const auto start = std::chrono::steady_clock::now();
+        const tavo::CheckerAnswer answer = checker.Ask({{true, 80, true}}, "p", "a", 400);
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
+        EXPECT_EQ(answer.rgFindings.size(), static_cast<size_t>(nFindings)) << szReason;
+        EXPECT_TRUE(*szReason == '\0' ? answer.szReason.empty() : answer.szReason.find(szReason) != std::string::npos)
+            << answer.szReason << " for " << szReason;
+        if (nFindings > 0) {
+            EXPECT_TRUE(answer.rgFindings[0].blAnswered && answer.rgFindings[0].nSource == 65535);
+            for (const char* szPart : {"POST /base/v1/ports HTTP/1.1\r\n", "\r\nAuthorization: Bearer t\r\n"}) {
+                EXPECT_NE(server.Request().find(szPart), std::string::npos) << server.Request();
+            }
+        } else if (std::string(szToken) != "t") {
+            tavo::HttpClient(300).Get({"127.0.0.1", server.Port(), "/"});  // nobody else has asked it
+        }
+    }
+    EXPECT_NE(tavo::Checker({"ftp://h", "t", 1, 1}).Ask({}, "p", "a", 400).szReason, "");
 }
 
 TEST(PortTester, TheMarkerIsOursWhateverStoodThere) {
