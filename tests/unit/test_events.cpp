@@ -355,7 +355,7 @@ TEST(HttpClient, EndsInTimeAndTakesNoMoreThanItsBounds) {
         EXPECT_TRUE(took >= one.nTakes * 1ms && took < 2500ms) << one.szWhat << " " << took / 1ms;
         EXPECT_TRUE(one.enEnd != HttpEnd::kAnswered || answer.nCode == 200) << one.szWhat;
         if (one.nLimit == 0) {  // it may have ended before it was connected
-            tavo::HttpClient().Get({kRouter, server.Port(), "/"});
+            tavo::HttpClient(300).Get({kRouter, server.Port(), "/"});
         }
     }
     EXPECT_EQ(tavo::HttpClient().Get({kRouter, 1, "/"}).enEnd, HttpEnd::kUnreachable);

@@ -1,15 +1,28 @@
 // The IGD client, and what else is heard by UPnP, against hostile answers.
+#include <arpa/inet.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
 
+#include <atomic>
+#include <chrono>
+#include <set>
+#include <thread>
 #include <tuple>
 
+#include "ground/Descriptor.h"
+#include "tavo/core.h"
+#include "webserver.h"
 #include "wire/upnp/Description.h"
 #include "wire/upnp/Igd.h"
 #include "wire/upnp/Notify.h"
 #include "wire/upnp/Search.h"
 #include "wire/upnp/Soap.h"
+#include "world.h"
 
 namespace {
+
+using namespace std::chrono_literals;
 
 using tavo::IgdEntry;
 
@@ -71,6 +84,21 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_EQ(fnEvents("<eventSubURL>http://10.0.0.9/e</eventSubURL>"), "");
     EXPECT_EQ(fnEvents("<eventSubURL/>"), "");
     EXPECT_EQ(fnEvents(""), "");
+    for (const int nDepth : {10, 11}) {  // of the service's own elements, twelve with their root and their service
+        std::string szOpen, szClose;
+        for (int i = 0; i < nDepth; ++i) {
+            szOpen += "<a>";
+            szClose += "</a>";
+        }
+        EXPECT_EQ(tavo::ParseDescription("<root>" + szOpen +
+                                             "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
+                                             "</serviceType><controlURL>/c</controlURL></service>" +
+                                             szClose + "</root>",
+                                         location)
+                      .has_value(),
+                  nDepth == 10)
+            << nDepth;
+    }
     std::string szDeep;
     for (int i = 0; i < 5000; ++i) {
         szDeep += "<a>";
@@ -105,10 +133,12 @@ TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
         return fnModel("<manufacturer>" + szBrand + "</manufacturer>");
     };
     const std::string szLong(10000, '"');
-    EXPECT_EQ(fnBrand(szLong).size(), tavo::kMaxModelText + 2);
+    EXPECT_EQ(fnBrand(szLong), std::string(54, '"') + "~ddababc5||")
+        << "what is on a user's disk stays a router's name";
     EXPECT_EQ(fnBrand(szLong), fnBrand(szLong));
     EXPECT_NE(fnBrand(szLong), fnBrand(szLong + "x"));  // the difference lies behind the cut
-    EXPECT_EQ(fnBrand(std::string(tavo::kMaxModelText, 'x')), std::string(tavo::kMaxModelText, 'x') + "||");
+    EXPECT_EQ(fnBrand(std::string(63, 'x')), std::string(63, 'x') + "||");
+    EXPECT_EQ(fnBrand(std::string(64, 'x')).substr(50, 5), "xxxx~");
     EXPECT_EQ(fnBrand(std::string(53, 'x') + "\xc3\xa4" + szLong).find("\xc3"), std::string::npos);  // no half letter
 }
 
@@ -117,10 +147,19 @@ TEST(Igd, AnswersThatAreNoneAreGarbage) {
         return tavo::SoapAnswer({tavo::HttpEnd::kAnswered, nHttpCode, szXml}).Code();
     };
     EXPECT_EQ(fnCode(200, "<e><Body><r/></Body></e>"), tavo::kWireOk);
-    EXPECT_EQ(fnCode(500, "<e><Body><x:Fault><errorCode> 718 </errorCode></x:Fault></Body></e>"), 718);
-    for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>",
-                              "<e><Body><Fault><errorCode>1</errorCode></Fault></Body></e>",
-                              "<e><Body><Fault><errorCode>0</errorCode></Fault></Body></e>"}) {
+    for (const auto& [szCode, nCode] : {std::pair(" 718 ", 718),
+                                        {"100", 100},
+                                        {"99", tavo::kWireGarbage * 1},
+                                        {"1", -3},
+                                        {"0", -3},
+                                        {"x", -3},
+                                        {"", -3}}) {
+        EXPECT_EQ(
+            fnCode(500, std::string("<e><Body><x:Fault><errorCode>") + szCode + "</errorCode></x:Fault></Body></e>"),
+            nCode)
+            << szCode;
+    }
+    for (const char* szXml : {"", "<html/>", "<e><Body><Fault/></Body></e>", "<e><Body>"}) {
         EXPECT_EQ(fnCode(200, szXml), tavo::kWireGarbage) << szXml;
     }
     EXPECT_EQ(fnCode(404, "<e><Body><r/></Body></e>"), tavo::kWireGarbage);
@@ -141,8 +180,16 @@ public:
     tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string& szBody) override {
         ++mNPosts;
         mSzAsked = szBody;
-        return {tavo::HttpEnd::kAnswered, 200, "<e><Body><r>" + mSzAnswer + "</r></Body></e>"};
+        return mNFault == 0 ? Said(mSzAnswer) : Fault(mNFault);
     }
+    static tavo::HttpAnswer Said(const std::string& szText) {
+        return {tavo::HttpEnd::kAnswered, 200, "<e><Body><r>" + szText + "</r></Body></e>"};
+    }
+    static tavo::HttpAnswer Fault(int nCode) {
+        return {tavo::HttpEnd::kAnswered, 500,
+                "<e><Body><Fault><errorCode>" + std::to_string(nCode) + "</errorCode></Fault></Body></e>"};
+    }
+    int mNFault = 0;
     std::string mSzVersion = "2";
     std::string mSzAnswer;
     std::string mSzAsked;
@@ -201,17 +248,19 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
 class Table : public Canned {
 public:
     tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string&) override {
+        gNClockJumped += mNSeconds;
         if (mRgEntries.empty()) {
-            return {tavo::HttpEnd::kAnswered, 500, "<e><Body><Fault><errorCode>713</errorCode></Fault></Body></e>"};
+            return Fault(mNEnd);
         }
         const auto [nPort, szClient] = mRgEntries.front();
         mRgEntries.erase(mRgEntries.begin());
-        return {tavo::HttpEnd::kAnswered, 200,
-                "<e><Body><r><NewExternalPort>" + std::to_string(nPort) +
+        return Said("<NewExternalPort>" + std::to_string(nPort) +
                     "</NewExternalPort><NewProtocol>TCP</NewProtocol><NewInternalPort>5</NewInternalPort>"
                     "<NewInternalClient>" +
-                    szClient + "</NewInternalClient></r></Body></e>"};
+                    szClient + "</NewInternalClient>");
     }
+    int mNEnd = 713;
+    int mNSeconds = 0;  // that each answer takes
     std::vector<std::pair<int, std::string>> mRgEntries;
 };
 
@@ -232,6 +281,277 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
         EXPECT_EQ(rgMappings.size(), nShown);
         EXPECT_EQ(rgMappings.at(0).szClient, szOne);
     }
+}
+
+TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
+    struct Case {
+        int nEntries;
+        int nEnd;
+        int nSeconds;
+        int nCode;
+        size_t nShown;
+    };
+    const Case rgCases[] = {{0, 713, 0, 0, 0},   {2, 713, 0, 0, 2},
+                            {0, 714, 0, 0, 0},   {2, 714, 0, 0, 2},
+                            {2, 402, 0, 0, 2},   {0, 402, 0, 402, 0},
+                            {2, 501, 0, 501, 0}, {0, 401, 0, 401, 0},
+                            {7, 713, 1, 0, 7},   {99, 713, 1, tavo::kWireTooLong, 8}};
+    for (const Case& one : rgCases) {
+        const auto pHttp = std::make_shared<Table>();
+        for (int i = 1; i <= one.nEntries; ++i) {
+            pHttp->mRgEntries.emplace_back(i, "192.168.1.5");
+        }
+        pHttp->mNEnd = one.nEnd;
+        pHttp->mNSeconds = one.nSeconds;
+        std::vector<IgdEntry> rgMappings;
+        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->List(rgMappings), one.nCode) << &one - rgCases;
+        EXPECT_EQ(rgMappings.size(), one.nShown) << &one - rgCases;
+    }
+}
+
+TEST(Igd, WhatAnEntryAndAnAddressSay) {
+    const auto pHttp = std::make_shared<Canned>();
+    const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp);
+    const auto fnTag = [](const char* szName, const char* szText) {
+        return std::string("<") + szName + ">" + szText + "</" + szName + ">";
+    };
+    const std::tuple<const char*, const char*, const char*, const char*, std::string> rgCases[] = {
+        {"65535", "192.168.1.5", "60", "1", "65535 60 on"},
+        {"1", "192.168.1.5", "", "", "1 0 on"},
+        {"1", "192.168.1.5", "4294967295", "0", "1 4294967295 off"},
+        {"1", "192.168.1.5", "-1", "false", "1 0 off"},
+        {"1", "192.168.1.5", "4294967296", "no", "1 0 off"},
+        {"65536", "192.168.1.5", "0", "1", "none"},
+        {"", "192.168.1.5", "0", "1", "none"},
+        {"1", "192.168.1", "0", "1", "none"},
+        {"1", "", "0", "1", "none"}};
+    for (const auto& [szPort, szClient, szLease, szEnabled, szRead] : rgCases) {
+        pHttp->mSzAnswer = fnTag("NewInternalPort", szPort) + fnTag("NewInternalClient", szClient) +
+                           fnTag("NewLeaseDuration", szLease) + fnTag("NewEnabled", szEnabled);
+        IgdEntry entry;
+        entry.szProtocol = "as";
+        const int nCode = pIgd->Get("UDP", 65535, entry);
+        EXPECT_EQ(nCode, szRead == "none" ? tavo::kWireGarbage : tavo::kWireOk);
+        EXPECT_EQ(nCode != 0 ? "none"
+                             : std::to_string(entry.nBoxPort) + " " + std::to_string(entry.nLease) +
+                                   (entry.blEnabled ? " on" : " off"),
+                  szRead);
+        EXPECT_EQ(entry.szProtocol, nCode == 0 ? "UDP" : "as");
+        EXPECT_NE(pHttp->mSzAsked.find("<NewExternalPort>65535</NewExternalPort><NewProtocol>UDP</NewProtocol>"),
+                  std::string::npos);
+        EXPECT_EQ(pIgd->GetAt(9, entry), tavo::kWireOk) << "one that makes no sense is there, and nothing of ours";
+        EXPECT_TRUE(entry.szProtocol.empty() && !entry.blEnabled);
+    }
+    std::string szAddress = "as it was";
+    for (const char* szSaid : {"", "1.2.3", "evil"}) {
+        pHttp->mSzAnswer = fnTag("NewExternalIPAddress", szSaid);
+        EXPECT_EQ(pIgd->ExternalAddress(szAddress), tavo::kWireGarbage);
+        EXPECT_EQ(szAddress, "as it was");
+    }
+    pHttp->mSzAnswer = fnTag("NewExternalIPAddress", " 198.41.0.4 ");
+    EXPECT_EQ(pIgd->ExternalAddress(szAddress), tavo::kWireOk);
+    EXPECT_EQ(szAddress, "198.41.0.4");
+    std::vector<IgdEntry> rgMappings;
+    EXPECT_EQ(pIgd->ListRange("UDP", 7, 9, rgMappings), tavo::kWireOk);
+    EXPECT_NE(pHttp->mSzAsked.find("<NewStartPort>7</NewStartPort><NewEndPort>9</NewEndPort><NewProtocol>UDP<"),
+              std::string::npos);
+    pHttp->mNFault = 606;
+    pHttp->mNPosts = 0;
+    EXPECT_EQ(pIgd->ExternalAddress(szAddress), 606);
+    EXPECT_EQ(pIgd->Remove("TCP", 1), 606);
+    EXPECT_EQ(pIgd->Get("TCP", 1, rgMappings.emplace_back()), 606);
+    EXPECT_EQ(pIgd->GetAt(0, rgMappings.back()), 606);
+    EXPECT_EQ(pIgd->ListRange("TCP", 1, 2, rgMappings), 606);
+    EXPECT_EQ(pIgd->ListRange("TCP", 1, 2, rgMappings), 401) << "one that could not once is not asked again";
+    EXPECT_EQ(pHttp->mNPosts, 5);
+}
+
+// A home network on the loopback device, with a gateway that answers searches.
+class SearchTest : public testing::Test {
+protected:
+    static constexpr char kGateway[] = "192.168.77.1";
+    static constexpr char kBox[] = "192.168.77.5";
+
+    void SetUp() override {
+        for (const char* szAddress : {kGateway, kBox}) {
+            ASSERT_EQ(TLIBCSystem((std::string("ip address add dev lo ") + szAddress).c_str()), 0);
+        }
+        mFd = SocketAt(kGateway, 1900);
+    }
+    void TearDown() override {
+        for (const char* szAddress : {kGateway, kBox}) {
+            TLIBCSystem((std::string("ip address del dev lo ") + szAddress + "/32").c_str());
+        }
+    }
+    static tavo::Descriptor SocketAt(const char* szAddress, uint16_t nPort) {
+        tavo::Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+        sockaddr_in own = {};
+        own.sin_family = AF_INET;
+        own.sin_port = htons(nPort);
+        inet_pton(AF_INET, szAddress, &own.sin_addr);
+        EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
+        return fd;
+    }
+    static std::string Answer(const std::string& szPlace, const char* szHost = kGateway) {
+        return std::string("HTTP/1.1 200 OK\r\nLOCATION: http://") + szHost + szPlace + "\r\n\r\n";
+    }
+    // Takes the questions that are there. True when there was one.
+    bool Hear() {
+        char szQuestion[1000] = {};
+        socklen_t nLength = sizeof(mFrom);
+        bool blHeard = false;
+        while (recvfrom(mFd.Get(), szQuestion, sizeof(szQuestion) - 1, 0, reinterpret_cast<sockaddr*>(&mFrom),
+                        &nLength) > 0) {
+            mRgszTargets.push_back(std::string(szQuestion).substr(std::string(szQuestion).find("ST: ")));
+            blHeard = true;
+        }
+        return blHeard;
+    }
+    void Say(const std::string& szText) const { Say(mFd, szText); }
+    void Say(const tavo::Descriptor& fd, const std::string& szText) const {
+        sendto(fd.Get(), szText.data(), szText.size(), 0, reinterpret_cast<const sockaddr*>(&mFrom), sizeof(mFrom));
+    }
+    // fnTurn: what the gateway does each time that the search looks whether it is to stop.
+    bool Search(int nMilliseconds, const std::function<void()>& fnTurn, int nPort = 0, bool blTakes = false) {
+        mRgszTried.clear();
+        return tavo::SearchGateway(
+            kGateway, kBox, nMilliseconds, nPort,
+            [&](const tavo::HttpUrl& url) {
+                mRgszTried.push_back(url.szPath);
+                return blTakes;
+            },
+            [&] {
+                fnTurn();
+                return mBlStop;
+            });
+    }
+
+    tavo::Descriptor mFd;
+    sockaddr_in mFrom = {};
+    std::vector<std::string> mRgszTargets;
+    std::vector<std::string> mRgszTried;
+    bool mBlStop = false;
+};
+
+TEST_F(SearchTest, AsksForEachKindAgainAndAgainUntilItsLimit) {
+    for (const auto& [nMilliseconds, nAskings] : {std::pair(100, 1U), {400, 2U}, {900, 3U}}) {
+        mRgszTargets.clear();
+        const auto start = std::chrono::steady_clock::now();
+        EXPECT_FALSE(Search(nMilliseconds, [this] { Hear(); }));
+        const auto took = std::chrono::steady_clock::now() - start;
+        EXPECT_TRUE(took >= nMilliseconds * 1ms && took < nMilliseconds * 1ms + 500ms) << took / 1ms;
+        EXPECT_EQ(mRgszTargets.size(), 4 * nAskings) << nMilliseconds;
+        EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), 4U);
+    }
+    mBlStop = true;
+    EXPECT_FALSE(Search(30000, [] {}));
+}
+
+TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
+    const tavo::Descriptor fdNeighbour = SocketAt(kBox, 0);
+    bool blSaid = false;
+    const auto fnTalk = [&] {
+        if (Hear() && !std::exchange(blSaid, true)) {
+            Say(fdNeighbour, Answer("/neighbour"));
+            Say(Answer("/other", kBox));
+            Say(Answer("/a"));
+            Say(Answer("/a"));
+            Say(Answer("/b"));
+        }
+    };
+    EXPECT_FALSE(Search(300, fnTalk));
+    EXPECT_EQ(mRgszTried, (std::vector<std::string>{"/a", "/b"}));
+    blSaid = false;
+    EXPECT_TRUE(Search(30000, fnTalk, 50123, true));
+    EXPECT_EQ(mRgszTried, std::vector<std::string>{"/a"});
+    EXPECT_EQ(ntohs(mFrom.sin_port), 50123);
+    blSaid = false;
+    const tavo::Descriptor fdTaken = SocketAt(kBox, 50124);
+    EXPECT_TRUE(Search(30000, fnTalk, 50124, true)) << "from another port";
+    int nPlace = 0;
+    gLog.clear();
+    EXPECT_FALSE(Search(30000, [&] {
+        if (Hear() || nPlace > 0) {
+            Say(Answer("/" + std::to_string(nPlace++)));
+            Say("HTTP/1.1 404 no\r\n\r\n");
+        }
+    }));
+    EXPECT_EQ(mRgszTried.size(), 16U) << "one that names more is playing games";
+    EXPECT_EQ(gLog.size(), 8U) << "and the log is not filled";
+}
+
+// The last of five questions is asked after three seconds, and silence believed after three more.
+TEST_F(SearchTest, IsOverThreeSecondsAfterTheLastWord) {
+    for (const int nSpeaks : {0, 5}) {
+        const time_t nStart = gNClockJumped;
+        int nSaid = 0;
+        EXPECT_FALSE(Search(30000, [&] {
+            Hear();
+            if (gNClockJumped - nStart == nSpeaks && nSpeaks != 0 && nSaid++ < 2) {
+                Say("HTTP/1.1 404 no\r\n\r\n");
+                return;
+            }
+            ++gNClockJumped;
+        }));
+        EXPECT_NEAR(static_cast<double>(gNClockJumped - nStart), nSpeaks + (nSpeaks == 0 ? 6.5 : 3.5), 0.6) << nSpeaks;
+    }
+}
+
+TEST_F(SearchTest, TheGatewaysOwnAnnouncementsAreNews) {
+    tavo::Announcements announcements;
+    EXPECT_FALSE(announcements.TakeNews(kGateway));
+    announcements.Listen(kBox);
+    ASSERT_GE(announcements.Fd(), 0);
+    inet_pton(AF_INET, "239.255.255.250", &mFrom.sin_addr);
+    mFrom.sin_family = AF_INET;
+    mFrom.sin_port = htons(1900);
+    const auto fnIsNews = [&](const char* szFrom, const std::string& szBoot) {
+        const tavo::Descriptor fd = SocketAt(szFrom, 0);
+        in_addr own = {};
+        inet_pton(AF_INET, szFrom, &own);
+        setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &own, sizeof(own));
+        Say(fd, "NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: u\r\nBOOTID.UPNP.ORG: " + szBoot + "\r\n\r\n");
+        return announcements.TakeNews(kGateway);
+    };
+    EXPECT_FALSE(fnIsNews(kBox, "1"));
+    EXPECT_TRUE(fnIsNews(kGateway, "1"));
+    EXPECT_FALSE(fnIsNews(kGateway, "1"));
+    EXPECT_TRUE(fnIsNews(kGateway, "2"));
+    announcements.Listen("no address");
+    EXPECT_EQ(announcements.Fd(), -1);
+}
+
+TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
+    const std::string szXml =
+        "<root><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1</serviceType>"
+        "<controlURL>/c</controlURL></service></root>";
+    const std::string szPage =
+        "HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(szXml.size()) + "\r\n\r\n" + szXml;
+    for (const char* szHost : {kGateway, kBox}) {
+        WebServer server(szPage, szHost);
+        std::string szPlace = std::string("http://") + szHost + ":" + std::to_string(server.Port()) + "/x";
+        const auto pIgd = tavo::Igd::Find(kGateway, kBox, 300, &szPlace);
+        EXPECT_EQ(pIgd != nullptr, szHost == kGateway) << szHost;
+        if (pIgd == nullptr) {
+            tavo::HttpClient().Get({szHost, server.Port(), "/nobody"});
+            EXPECT_NE(server.Request().find("/nobody"), std::string::npos) << "it was asked";
+        }
+    }
+    WebServer server(szPage, kGateway);
+    std::atomic<bool> blEnd = false;
+    std::thread gateway([&] {
+        while (!blEnd) {
+            if (Hear()) {
+                Say(Answer(":" + std::to_string(server.Port()) + "/found"));
+            }
+            poll(nullptr, 0, 10);
+        }
+    });
+    std::string szPlace = "http://192.168.77.1:1/gone";
+    EXPECT_NE(tavo::Igd::Find(kGateway, kBox, 5000, &szPlace), nullptr);
+    blEnd = true;
+    gateway.join();
+    EXPECT_TRUE(szPlace.ends_with("/found")) << szPlace;
 }
 
 TEST(Notify, ALifeIsANumberOrAPlace) {
