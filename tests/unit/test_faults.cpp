@@ -99,6 +99,11 @@ TEST_F(Faults, APairThatCannotBeSetStopsTheRule) {
         int nRules = 7;
         EXPECT_EQ(writer.GetRules(nRules), 1);
         EXPECT_EQ(nRules, 0);
+        FailToSet("count");
+        nRules = 7;
+        EXPECT_EQ(writer.GetRules(nRules), 0);
+        EXPECT_EQ(nRules, 0);
+        gStage = {};
     }
 }
 

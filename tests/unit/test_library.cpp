@@ -137,6 +137,51 @@ TEST_F(Library, RuleFilesThatCannotBeConverted) {
     EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
 }
 
+// One rule in one call, from the reader and from the section.
+TEST_F(Library, ARuleIsToldWholeOrNotAtAll) {
+    const std::pair<const char*, const char*> rgCases[] = {
+        {"enabled=1\ns_port=1\nr_port=2\nprotocol name=tcp\nservice_id=W\n", "1 2 1 tcp W"},
+        {"enabled=0\ns_port=1\nr_port=2\nprotocol name=udp\n", "0 2 1 udp "},
+        {"s_port=1\nr_port=2\nprotocol name=tcp\n", "get rule protocol failed"},
+        {"enabled=1\ns_port=1\nr_port=2\n", "get rule protocol failed"},
+        {"enabled=1\ns_port=1\nprotocol name=tcp\n", "get rule port failed"},
+        {"enabled=1\nr_port=1\nprotocol name=tcp\n", "get rule port failed"}};
+    for (const auto& [szText, szTold] : rgCases) {
+        Write(kRuleConf, std::string("[7]\n") + szText);
+        RouterRuleConfReader reader(false);
+        ASSERT_EQ(reader.StartNextRule(), 1);
+        TAVO_PF_CONF* pConf = TAVOPFRuleGet();
+        for (const bool blReader : {true, false}) {
+            std::string szId, szRouter, szBox, szProtocol, szService, szExtra;
+            bool blEnabled = false;
+            gLog.clear();
+            const int nResult = blReader ? reader.GetRuleInfo(blEnabled, szRouter, szBox, szProtocol, szService)
+                                         : PF_CONF::GetRuleInfo(szId, blEnabled, szRouter, szBox, szProtocol, szService,
+                                                                szExtra, pConf);
+            EXPECT_EQ(nResult == 1 ? std::to_string(blEnabled) + " " + szRouter + " " + szBox + " " + szProtocol + " " +
+                                         szService
+                                   : gLog.back(),
+                      szTold);
+            EXPECT_EQ(nResult, gLog.empty() ? 1 : 0);
+            EXPECT_TRUE(blReader || szId == "7");
+        }
+        TAVOPFConfFree(pConf);
+        int nRules = 7;
+        EXPECT_EQ(reader.GetRulesNumber(nRules), 1);
+        EXPECT_EQ(nRules, 1);
+        EXPECT_EQ(reader.NextRule(), 0);
+        EXPECT_EQ(reader.NextRule(), 0);
+        EXPECT_TRUE(Logged("next rule failed"));
+    }
+    std::filesystem::remove(kRuleConf);
+    EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), 0);
+    std::string szText;
+    bool blEnabled = false;
+    gLog.clear();
+    EXPECT_EQ(PF_CONF::GetRuleInfo(szText, blEnabled, szText, szText, szText, szText, szText, nullptr), 0);
+    EXPECT_EQ(gLog, std::vector<std::string>{"pConf is NULL"});
+}
+
 TEST_F(Library, ALockHeldElsewhereCostsNoDescriptors) {
     const auto fnOpen = [] { return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}); };
     int fd = -1;

@@ -116,14 +116,23 @@ struct Core {
         record.TurnTo({"192.168.1.1", szHardware});
         return tavo::BringInLine(
             router, rgWanted, record, habit,
-            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0; }});
+            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0 && !blDiskFull; }});
     }
     std::string szBox = kBox;
     tavo::Record record{"", "boot"};
     tavo::Habits habit;
     int64_t nNow = 1000;
     int nSaves = 0;
+    bool blDiskFull = false;
 };
+
+std::vector<RouterMapping> Wanted(int nPorts) {
+    std::vector<RouterMapping> rgWanted;
+    for (int i = 1; i <= nPorts; ++i) {
+        rgWanted.push_back(Entry(static_cast<uint16_t>(i), static_cast<uint16_t>(i), "", "tavo:a"));
+    }
+    return rgWanted;
+}
 
 TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     MemoryRouter router;
@@ -149,7 +158,7 @@ TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
     EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
     EXPECT_EQ((router.mMapTable[{"TCP", 6}].nBoxPort), 9);
     EXPECT_EQ((router.mMapTable[{"TCP", 4}].szClient), "192.168.1.9");
-    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease) << "of an age that nobody knows: renewed";
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), 3600U) << "of an age that nobody knows: renewed";
     EXPECT_EQ(result.nNextSeconds, 100) << "the other program's lease ends before half of ours is over";
 
     router.mNCalls = 0;
@@ -168,10 +177,7 @@ TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
 }
 
 TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
-    std::vector<RouterMapping> rgWanted;
-    for (uint16_t nPort = 1; nPort <= 10; ++nPort) {
-        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
-    }
+    const std::vector<RouterMapping> rgWanted = Wanted(10);
     // What the range answers, what it hides, what the router swallows: the calls for a listing, ten looks, ten
     // mappings and their proof, and the status of the fifth.
     const std::tuple<int, int, int, int, const char*> rgCases[] = {
@@ -206,10 +212,7 @@ TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
         }
         std::vector<std::string> mRgszRanges;
     };
-    std::vector<RouterMapping> rgWanted;
-    for (uint16_t nPort = 1; nPort <= 70; ++nPort) {
-        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
-    }
+    std::vector<RouterMapping> rgWanted = Wanted(70);
     for (const uint16_t nPort : {uint16_t{70}, uint16_t{71}, uint16_t{72}, uint16_t{73}, uint16_t{200}}) {
         rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
         rgWanted.back().szProtocol = "UDP";
@@ -492,12 +495,11 @@ TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
     };
     Core core;
     Slow router(core.nNow);
-    std::vector<RouterMapping> rgWanted;
-    for (uint16_t nPort = 1; nPort <= 300; ++nPort) {
-        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
-    }
+    const std::vector<RouterMapping> rgWanted = Wanted(300);
     for (int i = 0; i < 12; ++i) {
+        const int64_t nStart = core.nNow;
         const auto result = core.Run(router, rgWanted);
+        EXPECT_EQ(core.nNow - nStart, 151);
         ASSERT_EQ(result.rgOutcomes.size(), rgWanted.size());
         EXPECT_TRUE(result.blUnfinished);
         EXPECT_TRUE(result.transport.IsOk()) << "slow is not silent";
@@ -507,6 +509,107 @@ TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
         }
     }
     EXPECT_EQ(router.mMapTable.size(), rgWanted.size());
+}
+
+// Of a router that takes its time: how many are looked at before the first is asked for, and how long a yes is left
+// open.
+TEST(Mapping, LooksAndYesesAreOfAFewSeconds) {
+    struct Slow : MemoryRouter {
+        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+            Confirm(nPort);
+            nLooks += setOpen.empty() && nFirstLooks == 0 ? 1 : 0;
+            nNow += nLookSeconds;
+            return MemoryRouter::Get(szProtocol, nPort, mapping);
+        }
+        RouterReply Add(RouterMapping& mapping) override {
+            nFirstLooks = nFirstLooks == 0 ? nLooks : nFirstLooks;
+            nNow += 1 - nLookSeconds;
+            setOpen.emplace(nNow, mapping.nRouterPort);
+            return MemoryRouter::Add(mapping);
+        }
+        void Confirm(uint16_t nPort) {
+            std::erase_if(setOpen, [&](const auto& open) {
+                nLongest = open.second == nPort ? std::max(nLongest, nNow - open.first) : nLongest;
+                return open.second == nPort;
+            });
+        }
+        explicit Slow(int64_t& nCoresNow) : nNow(nCoresNow) {}
+        int64_t& nNow;
+        int nLookSeconds = 1;
+        int nLooks = 0;
+        int nFirstLooks = 0;
+        int64_t nLongest = 0;
+        std::set<std::pair<int64_t, uint16_t>> setOpen;
+    };
+    for (const int nLookSeconds : {0, 1}) {
+        Core core;
+        Slow router(core.nNow);
+        router.nLookSeconds = nLookSeconds;
+        core.Run(router, Wanted(70));
+        EXPECT_EQ(router.nFirstLooks, nLookSeconds == 0 ? 70 : 21);
+        EXPECT_TRUE(nLookSeconds != 0 || router.nLongest == 20) << router.nLongest;
+    }
+}
+
+TEST(Mapping, TheRecordIsWrittenAFewTimesHoweverManyThereAre) {
+    for (const auto& [nPorts, nSaves] : {std::pair(1, 3), {512, 3}, {513, 4}, {8192, 10}, {20000, 10}}) {
+        MemoryRouter router;
+        Core core;
+        core.Run(router, Wanted(nPorts));
+        EXPECT_EQ(core.nSaves, nSaves) << nPorts;
+        EXPECT_EQ(router.mMapTable.size(), static_cast<size_t>(nPorts));
+    }
+}
+
+TEST(Mapping, WhatFailsIsTriedAgainAfterAWhile) {
+    MemoryRouter router;
+    Core core;
+    core.blDiskFull = true;
+    auto result = core.Run(router, Wanted(1));
+    EXPECT_EQ(result.nNextSeconds, 60);
+    EXPECT_EQ(result.rgOutcomes[0].verdict.szWord, tavo::kUnrecorded);
+    EXPECT_TRUE(router.mMapTable.empty() && core.record.Here().empty());
+    core.blDiskFull = false;
+    EXPECT_EQ(core.Run(router, Wanted(1)).nNextSeconds, 1800);
+    core.nNow += 1800;
+    router.mNAddCode = 606;
+    result = core.Run(router, Wanted(1));
+    EXPECT_EQ(result.nNextSeconds, 60);
+    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 1"}) << "its lease runs on";
+
+    MemoryRouter silent;
+    silent.mNListCode = silent.mNGetCode = silent.mNAddCode = tavo::kWireTimeout;
+    EXPECT_FALSE(Core().Run(silent, Wanted(9)).transport.IsOk());
+    EXPECT_EQ(silent.mNCalls, 2);
+
+    for (const size_t nText : {size_t{64}, size_t{65}}) {
+        MemoryRouter taken;
+        taken.Put(Entry(1, 1, "192.168.1.9", std::string(nText, 'x').c_str()));
+        EXPECT_EQ(Core().Run(taken, Wanted(1)).rgOutcomes[0].verdict.holder->szDescription, std::string(64, 'x'));
+    }
+}
+
+TEST(Mapping, AShortLeaseIsRenewedEveryFiveSecondsAndSaidToBeShort) {
+    struct Short : MemoryRouter {
+        RouterReply Add(RouterMapping& mapping) override {
+            const RouterReply reply = MemoryRouter::Add(mapping);
+            mMapTable[tavo::KeyOf(mapping)].nLease = nLease;
+            return reply;
+        }
+        uint32_t nLease = 0;
+    };
+    for (const auto& [nLease, nNext, blShort] : {std::tuple(1U, 5, true),
+                                                 {9U, 5, true},
+                                                 {10U, 5, false},
+                                                 {12U, 6, false},
+                                                 {3600U, 1800, false},
+                                                 {0U, 0, false}}) {
+        Short router;
+        router.nLease = nLease;
+        const auto result = Core().Run(router, Wanted(1));
+        EXPECT_EQ(result.nNextSeconds, nNext) << nLease;
+        EXPECT_EQ(!result.rgOutcomes[0].verdict.szWhy.empty(), blShort) << nLease;
+    }
 }
 
 // One that keeps a mapping beyond its lease is not asked about it every few seconds for ever.
@@ -770,11 +873,17 @@ TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
     }
     const std::string szText = record.Text();
     // What of the second row is written over.
-    std::string szBeyond = szText;
-    szBeyond.replace(szBeyond.find("more=\"0\""), 8, "more=\"65535\"");
-    tavo::Record beyond(szBeyond, "one");
-    beyond.TurnTo({"192.168.1.1", "aa:bb"});
-    EXPECT_EQ(beyond.Here().size(), 2U) << "no range goes beyond the last port";
+    for (const auto& [szOld, szNew, nRows] : {std::tuple("more=\"0\"", "more=\"65534\"", 3U),
+                                              {"more=\"0\"", "more=\"65535\"", 2U},  // beyond the last port
+                                              {"router_port=\"3\"", "router_port=\"0\"", 2U},
+                                              {"box_port=\"3\"", "box_port=\"0\"", 2U},
+                                              {"protocol=\"TCP\"", "protocol=\"ICMP\"", 2U}}) {
+        std::string szOdd = szText;
+        szOdd.replace(szOdd.find(szOld), std::string(szOld).size(), szNew);
+        tavo::Record odd(szOdd, "one");
+        odd.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_EQ(odd.Here().size(), nRows) << szNew;
+    }
     for (const char* szDamaged : {"[192.168.1.1 TCP 2]", "router_port=\"2\"", "protocol=\"TCP\"\nrouter_port=\"2\""}) {
         std::string szBad = szText;
         szBad.replace(szText.find(szDamaged), 8, std::string("\0\xff\x1b\"=[\\q", 8));
@@ -790,6 +899,18 @@ TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
         odd.TurnTo({"192.168.1.1", "aa:bb"});
         EXPECT_TRUE((odd.Here()[{"TCP", 1}].IsDue(6000))) << szAsked;
     }
+}
+
+TEST(Record, OfOtherRoutersIsBounded) {
+    tavo::Record record("", "one");
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    for (int i = 1; i <= 5000; ++i) {
+        record.Here()[{"TCP", static_cast<uint16_t>(i)}] = {kBox, 1, "tavo:a", true, 0, 5000};
+    }
+    record.TurnTo({"192.168.1.1", "cc:dd"});
+    record.Prune(0);
+    record.TurnTo({"192.168.1.1", "aa:bb"});
+    EXPECT_EQ(record.Here().size(), 4096U);
 }
 
 TEST(Record, KeepsWhatMayHaveNoLease) {
@@ -876,10 +997,15 @@ TEST(Rules, EachOutcomeHasANameOfItsOwn) {
 TEST(Rules, AreTakenApartPairByPair) {
     using M = tavo::SingleMapping;
     EXPECT_EQ(*tavo::ExpandRule("ALL", "80", "8080"), (std::vector<M>{{"TCP", 80, 8080}, {"UDP", 80, 8080}}));
+    EXPECT_EQ(*tavo::ExpandRule(" Udp", "65535", "1"), (std::vector<M>{{"UDP", 65535, 1}}));
+    for (const char* szBoth : {"both", "TCP_UDP"}) {
+        EXPECT_EQ(tavo::ExpandRule(szBoth, "65534-65535", "1,2")->size(), 4U);
+    }
     EXPECT_EQ(*tavo::ExpandRule("tcp", "12-10, 1", "20-22,7"),
               (std::vector<M>{{"TCP", 10, 20}, {"TCP", 11, 21}, {"TCP", 12, 22}, {"TCP", 1, 7}}));
     const char* rgszBad[][3] = {{"tcp", "1-3", "1-2"}, {"icmp", "1", "1"}, {"tcp", "", ""},    {"tcp", "0", "1"},
-                                {"tcp", "65536", "1"}, {"tcp", "1x", "1"}, {"tcp", "1,", "1"}, {"tcp", "1-", "1"}};
+                                {"tcp", "65536", "1"}, {"tcp", "1x", "1"}, {"tcp", "1,", "1"}, {"tcp", "1-", "1"},
+                                {"tcp", "1", "65536"}, {"tcp", "-1", "1"}};
     for (const auto& rgszRule : rgszBad) {
         EXPECT_FALSE(tavo::ExpandRule(rgszRule[0], rgszRule[1], rgszRule[2])) << rgszRule[1];
     }

@@ -2,25 +2,35 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/file.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <functional>
+#include <set>
 #include <thread>
 #include <utility>
 
+#include "ground/Directory.h"
+#include "ground/FileLock.h"
+#include "ground/LogFile.h"
 #include "ground/OwnFile.h"
 #include "ground/PortText.h"
+#include "ground/Suffix.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
 #include "programs/common/RuleFile.h"
 #include "programs/tavohook/Hooks.h"
+#include "stage.h"
 #include "tavo/core.h"
 #include "tavo/log.h"
 #include "tavo/net.h"
 #include "tavo/portforward.h"
+#include "wire/upnptest/TestRules.h"
 #include "world.h"
 
 namespace {
@@ -171,9 +181,13 @@ TEST(Service, IsAskedForByTheSystemsNameAndItsManager) {
 }
 
 TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
-    const std::vector<std::string> rgValues = {"",      "plain", "two words",    "x\"; [192.168.1.1]\nuser=\"me",
-                                               "\\",    "\\\"",  "a=b#c",        "\r\n\t\x01\x7f",
-                                               "ärger", "[x]",   "' $(id) `id`", std::string(10000, '"')};
+    std::string szBytes;
+    for (int nByte = 1; nByte < 256; ++nByte) {
+        szBytes += static_cast<char>(nByte);
+    }
+    const std::vector<std::string> rgValues = {
+        "",      "plain", "two words",    "x\"; [192.168.1.1]\nuser=\"me", "\\", "\\\"", "a=b#c", "\r\n\t\x01\x7f",
+        "ärger", "[x]",   "' $(id) `id`", std::string(10000, '"'),         "#x", " x ",  szBytes};
     std::filesystem::create_directories("/tmp/t");
     for (const std::string& szValue : rgValues) {
         for (const std::string& szName : {std::string("s"), szValue}) {
@@ -201,8 +215,10 @@ TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
 TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
     EXPECT_EQ(tavo::ParseSections("# c\r\n\r\n [a] \r\nk = plain text \nq=\"x\" # c\n")->front().rgPairs[0].szValue,
               "plain text");
-    for (const char* szBad : {"k=v\n", "[a]\nnonsense\n", "[a]\nk=\"open\n", "[a]\nk=\"\\q\"\n", "[a]\nk=\"x\" y\n",
-                              "[a]\nk=\"\\x00\"\n", "[a]\n=v\n"}) {
+    EXPECT_EQ(tavo::ParseSections("[a]\nk=\"\\x09\\x4a\\x4A\\xAf\"\n")->front().rgPairs[0].szValue, "\tJJ\xaf");
+    for (const char* szBad :
+         {"k=v\n", "[a]\nnonsense\n", "[a]\nk=\"open\n", "[a]\nk=\"\\q\"\n", "[a]\nk=\"x\" y\n", "[a]\nk=\"\\x00\"\n",
+          "[a]\n=v\n", "[a]\nk=\"\\x4\"\n", "[a]\nk=\"\\x4g\"\n", "[a]\nk=\"\\x@1\"\n", "[a]\nk=\"x\\\"\n"}) {
         EXPECT_FALSE(tavo::ParseSections(szBad)) << szBad;
     }
 }
@@ -252,10 +268,16 @@ TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {
     TLIBCSzHashFree(pHash);
 
     std::string szMany;
-    for (int i = 0; i < 20000; ++i) {
+    for (int i = 0; i < 16384; ++i) {
         szMany += "[]\n";
     }
-    const std::string rgszRefused[] = {"[1]\nk=1\n[" + std::string(1024, 'x') + "]\nk=2\n", szMany,
+    for (const std::string& szText : {szMany, "[" + std::string(1023, 'x') + "]\n"}) {
+        Write("/etc/portforward/rule.conf", szText);
+        TAVO_PF_CONF* pConf = TAVOPFRuleGet();
+        EXPECT_NE(pConf, nullptr) << szText.size();
+        TAVOPFConfFree(pConf);
+    }
+    const std::string rgszRefused[] = {"[1]\nk=1\n[" + std::string(1024, 'x') + "]\nk=2\n", szMany + "[]\n",
                                        std::string("[1]\nk=\0\n", 9)};
     for (const std::string& szText : rgszRefused) {
         Write("/etc/portforward/rule.conf", szText);
@@ -289,15 +311,19 @@ TEST(LastError, NamesThePlaceInTheTreeThatFailed) {
 }
 
 TEST(SystemLog, ALineStaysOneLineOfPlainText) {
-    const char* rgszCases[][2] = {{"a\nb\r\t\x1b[2J\x7f", "a\\x0ab\\x0d\\x09\\x1b[2J\\x7f"},
-                                  {"\xc2\x9b"
-                                   "31m \xc3\xa4\xc2\xa0\\x",
-                                   "\\x9b31m \xc3\xa4\xc2\xa0\\x"},
-                                  {"\xc2", "\xc2"}};
+    const char* rgszCases[][2] = {
+        {"a\nb\r\t\x1b[2J\x7f", "a\\x0ab\\x0d\\x09\\x1b[2J\\x7f"},
+        {"\xc2\x9b"
+         "31m \xc3\xa4\xc2\xa0\\x",
+         "\\x9b31m \xc3\xa4\xc2\xa0\\x"},
+        {"\xc2", "\xc2"},
+        {"\x1f ~\x7f\xc2\x7f\xc2\x80\xc2\x9f\xc3\x80", "\\x1f ~\\x7f\xc2\\x7f\\x80\\x9f\xc3\x80"}};
     for (const auto& rgszCase : rgszCases) {
         gLog.clear();
+        errno = ENOTTY;
         tavo::SysLog(LOG_ERR, "say %s", rgszCase[0]);
         EXPECT_EQ(gLog, std::vector<std::string>{rgszCase[1]});
+        EXPECT_EQ(errno, ENOTTY);
     }
     gLog.clear();
     tavo::SysLog(LOG_ERR, "say %s", std::string(100000, '\n').c_str());
@@ -365,7 +391,8 @@ TEST(OwnFile, StandsWhereOthersHavePutSomethingOrItIsSaidThatItDoesNot) {
         {"a link", [] { symlink("/tmp/t/victim", kOwn); }, 0},
         {"a second name of a file", [] { link("/tmp/t/victim", kOwn); }, 0},
         {"a pipe", [] { mkfifo(kOwn, 0666); }, 0},
-        {"one that others write", [] { Write(kOwn, "theirs"), chmod(kOwn, 0666); }, 0},
+        {"one that a group writes", [] { Write(kOwn, "theirs"), chmod(kOwn, 0620); }, 0},
+        {"one that others write", [] { Write(kOwn, "theirs"), chmod(kOwn, 0602); }, 0},
         {"a disk that fails", [] { gNRenamesLeft = 0; }, EIO}};
     gBlKilled = false;
     for (const auto& [szWhat, fnPlant, nErrno] : rgCases) {
@@ -384,6 +411,127 @@ TEST(OwnFile, StandsWhereOthersHavePutSomethingOrItIsSaidThatItDoesNot) {
     EXPECT_TRUE(tavo::MakeOwnFile(kOwn));
     EXPECT_EQ(Read(kOwn), "held");
     EXPECT_FALSE(tavo::MakeOwnFile("/tmp/t/nowhere/own"));
+}
+
+TEST(Files, DirectoriesNamesAndLogs) {
+    for (const auto& [szPath, szDir] : {std::pair("/a/b", "/a/"), {"/a", "/"}, {"a", "."}, {"a/b/", "a/b/"}}) {
+        EXPECT_EQ(tavo::DirectoryOf(szPath), szDir);
+    }
+    for (const auto& [szPart, blGood] : {std::pair("", false),
+                                         {".", false},
+                                         {"..", false},
+                                         {"a/b", false},
+                                         {"/", false},
+                                         {"...", true},
+                                         {"a", true}}) {
+        EXPECT_EQ(tavo::IsPathPart(szPart), blGood) << szPart;
+    }
+    EXPECT_EQ(tavo::PrintableText("\x1f a~\x7f\xff", 4), " a~\xff");
+    EXPECT_EQ(tavo::PrintableText("abcd", 3), "abc");
+    std::filesystem::remove_all("/tmp/t/made");
+    const mode_t nMask = umask(0077);
+    EXPECT_TRUE(tavo::MakeDirectory("/tmp/t/made"));
+    umask(0);
+    struct stat status = {};
+    EXPECT_TRUE(stat("/tmp/t/made", &status) == 0 && (status.st_mode & 07777U) == 0755U);
+    EXPECT_TRUE(tavo::MakeDirectory("/tmp/t/made")) << "it is there";
+    EXPECT_FALSE(tavo::MakeDirectory("/tmp/t/none/made"));
+    EXPECT_EQ(tavo::NamesIn("/tmp/t/made"), std::vector<std::string>());
+    EXPECT_TRUE(tavo::AppendLogLine("/tmp/t/made/log", "one") && tavo::AppendLogLine("/tmp/t/made/log", "two"));
+    umask(nMask);
+    EXPECT_EQ(Read("/tmp/t/made/log"), "one\ntwo\n");
+    EXPECT_TRUE(stat("/tmp/t/made/log", &status) == 0 && (status.st_mode & 07777U) == 0640U);
+    symlink("/tmp/t/made/log", "/tmp/t/made/link");
+    EXPECT_FALSE(tavo::AppendLogLine("/tmp/t/made/link", "three")) << "no link is followed";
+    EXPECT_FALSE(tavo::AppendLogLine("/dev/full", "three")) << "not written";
+    EXPECT_EQ(tavo::NamesIn("/tmp/t/made")->size(), 2U);
+    EXPECT_EQ(tavo::NamesIn("/tmp/t/none"), std::nullopt);
+    const std::string szTime = tavo::LogTime();
+    EXPECT_TRUE(szTime.size() == 24 && szTime[10] == 'T') << szTime;
+}
+
+// No two neighbours of one kind, all three kinds, and a last one that follows from the others.
+TEST(Suffix, IsWhatItsMakerMakesAndNothingThatAPersonWrites) {
+    std::set<std::string> setMade;
+    for (int i = 0; i < 200; ++i) {
+        const std::string szMade = tavo::MakeSuffix();
+        EXPECT_TRUE(tavo::IsSuffix(szMade)) << szMade;
+        std::string szOther = szMade;
+        szOther.back() =
+            static_cast<char>(szMade.back() + (std::string("9zZ").find(szMade.back()) == szMade.npos ? 1 : -1));
+        EXPECT_FALSE(tavo::IsSuffix(szOther)) << szOther;
+        EXPECT_FALSE(tavo::IsSuffix(szMade + "a") || tavo::IsSuffix(szMade.substr(1))) << szMade;
+        setMade.insert(szMade);
+    }
+    EXPECT_GT(setMade.size(), 195U);
+    for (const char* szSuffix : {"backup", "0a0a0a", "a0B1-2", "aA0a0A", "20240101"}) {
+        EXPECT_EQ(tavo::IsSuffix(szSuffix), false) << szSuffix;
+    }
+    EXPECT_TRUE(tavo::IsSuffix("0aA0aF")) << "as those that lie on users' disks are";
+}
+
+TEST(FileLock, WaitsForAsLongAsItIsTold) {
+    const tavo::FileLock held("/tmp/t/lock");
+    ASSERT_TRUE(held.Try());
+    const tavo::FileLock other("/tmp/t/lock");
+    int nAsked = 0;
+    EXPECT_FALSE(other.Wait([&] { return ++nAsked < 3; }));
+    EXPECT_EQ(nAsked, 3);
+    EXPECT_FALSE(other.Try(LOCK_SH));
+    tavo::FileLock nowhere("/tmp/t/none/lock");
+    EXPECT_FALSE(nowhere.IsOpen() || nowhere.Try() || nowhere.Wait([] { return true; }));
+    struct stat status = {};
+    EXPECT_TRUE(stat("/tmp/t/lock", &status) == 0 && (status.st_mode & 07777U) == 0600U);
+}
+
+// The box's side of the compatibility test: what is written is read, and an order reaches a daemon that lives.
+TEST(TestRules, AreReadBackAndOrdersAreBounded) {
+    EXPECT_TRUE(tavo::RemoveTestRules()) << "there are none";
+    EXPECT_TRUE(tavo::LoadTestRules().empty());
+    EXPECT_TRUE(tavo::SaveTestRules({{1, 65535, true, "1"}, {65535, 2, false, "718"}}));
+    const auto rgRules = tavo::LoadTestRules();
+    ASSERT_EQ(rgRules.size(), 2U);
+    EXPECT_EQ(std::tuple(rgRules[0].nRouterPort, rgRules[0].nBoxPort, rgRules[0].blKept, rgRules[0].szResult),
+              std::tuple(1, 65535, true, "1"));
+    EXPECT_EQ(std::tuple(rgRules[1].nRouterPort, rgRules[1].nBoxPort, rgRules[1].blKept, rgRules[1].szResult),
+              std::tuple(65535, 2, false, "718"));
+    EXPECT_TRUE(tavo::RemoveTestRules());
+    EXPECT_TRUE(tavo::LoadTestRules().empty());
+    for (const auto& [szWord, blUnderWay] : {std::pair("processing", true), {"finished", false}, {"", false}}) {
+        Write(tavo::kTestProgress, std::string("upnp_add=\"") + szWord + "\"\n");
+        EXPECT_EQ(tavo::IsStepUnderWay("upnp_add"), blUnderWay) << szWord;
+    }
+    EXPECT_FALSE(tavo::IsStepUnderWay("upnp_delete"));
+    std::filesystem::remove(tavo::kTestProgress);
+
+    gStage = Stage();
+    gStage.blOn = true;
+    const auto fnSeconds = [](const std::function<void()>& fnCall) {
+        const time_t nStart = gNClockJumped;
+        gNClockStep = 1;
+        fnCall();
+        gNClockStep = 0;
+        return gNClockJumped - nStart;
+    };
+    EXPECT_EQ(fnSeconds([] { EXPECT_FALSE(tavo::SendTestOrder("delete")); }), 1) << "nobody is waited for";
+    gStage.alive.insert(tavo::kTestDaemon);
+    EXPECT_NEAR(static_cast<double>(fnSeconds([] { EXPECT_FALSE(tavo::SendTestOrder("delete")); })), 3.5, 0.6);
+    sockaddr_un own = {};
+    own.sun_family = AF_UNIX;
+    snprintf(own.sun_path, sizeof(own.sun_path), "%s", tavo::kTestSocket);
+    std::filesystem::create_directories("/var/run");
+    const tavo::Descriptor fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    ASSERT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
+    const auto fnHeard = [&] {
+        char szOrder[20] = {};
+        return recv(fd.Get(), szOrder, sizeof(szOrder) - 1, 0) < 0 ? "" : std::string(szOrder);
+    };
+    EXPECT_TRUE(tavo::SendTestOrder("modify"));
+    EXPECT_EQ(fnHeard(), "modify");
+    EXPECT_NEAR(static_cast<double>(fnSeconds([] { tavo::EndTestDaemon(); })), 13.5, 0.6) << "it does not end";
+    EXPECT_EQ(fnHeard(), "end");
+    gStage = Stage();
+    unlink(tavo::kTestSocket);
 }
 
 TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {

@@ -234,6 +234,7 @@ TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
     EXPECT_EQ(TLibTestUpnpCompatibility(3, nullptr, nullptr, nullptr, false), -1);
     EXPECT_TRUE(Logged("testCompResult is NULL"));
     EXPECT_EQ(mClient.rgszCalls, (std::vector<std::string>{"end", "end"}));
+    EXPECT_FALSE(Logged("final release:TavoUpnpTestTerminate() failed"));
 
     TestResult result = {};
     ASSERT_EQ(TLibTavoPortMapLock(), 0);
