@@ -135,37 +135,6 @@ TEST_F(Faults, ASettingThatCannotBeSetIsReportedWhereItMatters) {
     }
 }
 
-TEST_F(Faults, MemoryThatRunsOutAnywhereLosesNoRules) {
-    gBlOneFailure = true;
-    bool blFailed = true;
-    for (int i = 0; blFailed && i < 1000; ++i) {
-        Write(kRuleConf, kOldRules);
-        RouterRuleConfWriter writer;
-        ASSERT_EQ(Add(writer), 1);
-        blFailed = gBlAllocationFailed = false;
-        gNGoodAllocations = i;
-        const bool blSynced = writer.Sync() == 1;
-        gNGoodAllocations = -1;
-        blFailed = gBlAllocationFailed;
-        EXPECT_EQ(Read(kRuleConf) == kOldRules, !blSynced) << i;
-        EXPECT_EQ(Names(), Lines{"rule.conf"}) << i;
-        EXPECT_TRUE(blFailed || blSynced);
-    }
-    EXPECT_FALSE(blFailed);
-    int nReads = 0;
-    for (blFailed = true; blFailed && nReads < 1000; ++nReads) {
-        gBlAllocationFailed = false;
-        gNGoodAllocations = nReads;
-        const int nRules = CountRules();
-        gNGoodAllocations = -1;
-        blFailed = gBlAllocationFailed;
-        EXPECT_TRUE(nRules == 1 || (blFailed && nRules == -1)) << nReads;
-    }
-    EXPECT_FALSE(blFailed);
-    EXPECT_GT(nReads, 10);
-    gBlOneFailure = false;
-}
-
 TEST_F(Faults, AFullDiskLosesNothing) {
     ASSERT_EQ(mount("tmpfs", "/etc", "tmpfs", 0, "size=32k"), 0);
     const std::string szRouter = "[192.168.1.1]\nbrand=old\nsupport_router_upnp=yes\nsupport_router_natpmp=no\n";

@@ -291,6 +291,7 @@ TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
         int nCode;
         size_t nShown;
     };
+    const JumpingClock clock;
     const Case rgCases[] = {{0, 713, 0, 0, 0},   {2, 713, 0, 0, 2},
                             {0, 714, 0, 0, 0},   {2, 714, 0, 0, 2},
                             {2, 402, 0, 0, 2},   {0, 402, 0, 402, 0},
@@ -482,6 +483,7 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
 
 // The last of five questions is asked after three seconds, and silence believed after three more.
 TEST_F(SearchTest, IsOverThreeSecondsAfterTheLastWord) {
+    const JumpingClock clock;
     for (const int nSpeaks : {0, 5}) {
         const time_t nStart = gNClockJumped;
         int nSaid = 0;

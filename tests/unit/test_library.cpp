@@ -182,6 +182,103 @@ TEST_F(Library, ARuleIsToldWholeOrNotAtAll) {
     EXPECT_EQ(gLog, std::vector<std::string>{"pConf is NULL"});
 }
 
+// Each call by itself, from the first allocation that fails on: it fails, and says so.
+TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
+    const std::string szLong = "longer than a small string, so that it needs memory";
+    Write(kRouterConf, "[192.168.1.1]\nbrand=" + szLong + "\nmodel=M\nversion=1\n");
+    Write("/etc/portforward/router_upnp.db", "[" + szLong + "/M/1]\nsupport=yes\nmax=5\npfpath=" + szLong + "\n");
+    Write(kRuleConf, "[" + szLong + "]\nenabled=1\ns_port=" + std::string(50, '1') +
+                         "\nr_port=" + std::string(50, '2') + "\nprotocol name=" + szLong + "\nservice_id=" + szLong +
+                         "\nservice=" + szLong + "\n");
+    TAVO_PF_CONF* pConf = TAVOPFRuleGet();
+    RouterConfReader reader("192.168.1.1");
+    RouterUpnpDB upnp(szLong, "M", "1");
+    std::string szName = szLong + ": Model (" + szLong + ")";
+    char szPorts[8] = {};
+    const struct {
+        const char* szWhat;
+        std::function<int()> fnCall;
+        int nGood;
+        int nBad;
+    } rgCases[] = {
+        {"a text of the settings",
+         [&] {
+             std::string szText;
+             return reader.GetBrand(szText);
+         },
+         1, 0},
+        {"a rule's name",
+         [&] {
+             std::string szText;
+             return PF_CONF::GetRuleID(szText, pConf);
+         },
+         1, 0},
+        {"its protocol",
+         [&] {
+             std::string szText;
+             return PF_CONF::GetRuleProtocol(szText, pConf);
+         },
+         1, 0},
+        {"its service",
+         [&] {
+             std::string szText;
+             return PF_CONF::GetRuleServiceID(szText, pConf);
+         },
+         1, 0},
+        {"its service's name",
+         [&] {
+             std::string szText;
+             return PF_CONF::GetRuleServiceName(szText, pConf);
+         },
+         1, 0},
+        {"its ports",
+         [&] {
+             std::string szRouter, szBox;
+             return PF_CONF::GetRulePort(szRouter, szBox, pConf);
+         },
+         1, 0},
+        {"a router's name",
+         [&] {
+             std::string szA, szB, szC;
+             return SplitRouterName(szName.data(), szA, szB, szC);
+         },
+         1, 0},
+        {"settings that begin", [] { return RouterConfWriter(false).Init(); }, 1, 0},
+        {"a number among them",
+         [] {
+             RouterConfWriter writer(false);
+             return writer.SetMaxRule(5);
+         },
+         1, 0},
+        {"a rule added", [&] { return RouterRuleConfWriter().AddRule(7, true, "1", "2", "tcp", "", "w"); }, 1, 0},
+        {"what is known of UPnP",
+         [&] {
+             std::string szText;
+             return upnp.GetPfpath(szText);
+         },
+         1, 0},
+        {"ports read",
+         [] {
+             std::list<int> ports;
+             return TLibParsePorts(ports, "1,2");
+         },
+         0, -1},
+        {"ports written", [&] { return TestFuncToPorts(szPorts, 8, "1,2"); }, 0, -1},
+    };
+    for (const auto& one : rgCases) {
+        int nFailures = 0;
+        RunOutOfMemory([&](const auto& fnArm) {
+            fnArm();
+            const int nResult = one.fnCall();
+            gNGoodAllocations = -1;
+            EXPECT_EQ(nResult, gBlAllocationFailed ? one.nBad : one.nGood) << one.szWhat;
+            nFailures += gBlAllocationFailed ? 1 : 0;
+        });
+        EXPECT_GT(nFailures, 0) << one.szWhat;
+    }
+    TAVOPFConfFree(pConf);
+}
+
 TEST_F(Library, ALockHeldElsewhereCostsNoDescriptors) {
     const auto fnOpen = [] { return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}); };
     int fd = -1;
@@ -318,6 +415,15 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
         EXPECT_FALSE(desc.blSupportChangePort);
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+    }
+    Write(kRouterConf,
+          "[192.168.1.1]\nsupport_router_upnp=no\nsupport_router_natpmp=no\n[]\nbrand=B\nmodel=M\nversion=1\n");
+    for (const bool blChange : {true, false}) {
+        Write("/etc.defaults/portforward/routerdb/B/M/1/router.des",
+              std::string("[PF port page]\nchange router port=") + (blChange ? "yes" : "no") + "\n");
+        __tag_TAVO_ROUTER_DESC desc = {!blChange};
+        EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", &desc, nullptr, true), 0);
+        EXPECT_EQ(desc.blSupportChangePort, blChange);
     }
     auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
     EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", nullptr, &enErr, false), -1);

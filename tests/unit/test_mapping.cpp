@@ -557,6 +557,9 @@ TEST(Mapping, TheRecordIsWrittenAFewTimesHoweverManyThereAre) {
         Core core;
         core.Run(router, Wanted(nPorts));
         EXPECT_EQ(core.nSaves, nSaves) << nPorts;
+        core.nSaves = 0;
+        core.Run(router, Wanted(nPorts));
+        EXPECT_EQ(core.nSaves, 2) << "nothing new to be put there before the router is asked";
         EXPECT_EQ(router.mMapTable.size(), static_cast<size_t>(nPorts));
     }
 }
@@ -614,16 +617,18 @@ TEST(Mapping, AShortLeaseIsRenewedEveryFiveSecondsAndSaidToBeShort) {
 
 // One that keeps a mapping beyond its lease is not asked about it every few seconds for ever.
 TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
-    MemoryRouter router;
-    Core core;
-    core.nNow = 10000;
-    router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
-    router.mNRemoveCode = 606;
-    core.record.TurnTo({"192.168.1.1", ""});
-    core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - 7200};
-    const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
-    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 606"});
-    EXPECT_EQ(std::make_pair(result.nNextSeconds, result.rgOutcomes[0].verdict.nLease), std::make_pair(0, 0U));
+    for (const auto& [nAge, nNext, nLeft] : {std::tuple(7200, 0, 0U), {3601, 0, 0U}, {3600, 5, 1U}, {3590, 11, 10U}}) {
+        MemoryRouter router;
+        Core core;
+        core.nNow = 10000;
+        router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
+        router.mNRemoveCode = 606;
+        core.record.TurnTo({"192.168.1.1", ""});
+        core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - nAge};
+        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 606"});
+        EXPECT_EQ(std::pair(result.nNextSeconds, result.rgOutcomes[0].verdict.nLease), std::pair(nNext, nLeft)) << nAge;
+    }
 }
 
 // Where nothing can be seen, what is taken away blindly is only what must still be ours.

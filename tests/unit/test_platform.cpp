@@ -506,6 +506,7 @@ TEST(TestRules, AreReadBackAndOrdersAreBounded) {
 
     gStage = Stage();
     gStage.blOn = true;
+    const JumpingClock clock;
     const auto fnSeconds = [](const std::function<void()>& fnCall) {
         const time_t nStart = gNClockJumped;
         gNClockStep = 1;

@@ -206,29 +206,6 @@ TEST_F(Relay, StoredRulesThatCannotBeRead) {
     }
 }
 
-TEST_F(Relay, MemoryThatRunsOutLeavesNoArray) {
-    const __tag_TAVO_ROUTER_RULE rgStored[] = {Stored("udp", "1,2,3", "7,8,9", "web", false),
-                                               Stored("all", "5", "5", "", true)};
-    gBlOneFailure = true;  // so that the line can be written
-    bool blFailed = true;
-    for (long nGood = 0; blFailed && nGood < 200; ++nGood) {
-        OPERATION_RULE* pOut = nullptr;
-        int nOut = 7;
-        gBlAllocationFailed = false;
-        gNGoodAllocations = nGood;
-        const int nResult = CreateOperationRulesArray(Host(), &pOut, &nOut, rgStored, 2);
-        gNGoodAllocations = -1;
-        blFailed = gBlAllocationFailed;
-        EXPECT_EQ(nResult, blFailed ? -1 : 0) << nGood;
-        EXPECT_EQ(pOut == nullptr, blFailed) << nGood;
-        EXPECT_EQ(nOut, blFailed ? 0 : 2) << nGood;
-        FreeOperationRulesArray(pOut, nOut);
-    }
-    gBlOneFailure = false;
-    EXPECT_FALSE(blFailed);
-    EXPECT_TRUE(Logged("new set<int> failed"));
-}
-
 TEST_F(Relay, WhatDoesNotFitARule) {
     std::string szPorts = "10000";
     for (int nPort = 10002; szPorts.size() + 6 < 1024; nPort += 2) {

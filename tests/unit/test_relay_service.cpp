@@ -439,7 +439,7 @@ TEST_F(RelayService, MemoryThatRunsOutLosesNoRule) {
         said.insert(gLog.begin(), gLog.end());
     });
     for (const char* szLine : {"GetInitState() failed", "CreateOperationRulesArray(ruleConf) failed",
-                               "save rule failed", "test port connection failed"}) {
+                               "new set<int> failed", "save rule failed", "test port connection failed"}) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;
     }
 #ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out

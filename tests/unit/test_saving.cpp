@@ -373,34 +373,6 @@ void MakeTool(const std::string& szScript) {
     chmod(kTool, 0755);
 }
 
-TEST_F(Saving, KnowledgeBaseSurvivesMemoryThatRunsOut) {
-    Write("/etc.defaults/portforward/routerdb/B/M/generic", "version=\"1\"\n");
-    MakeTool("echo syntax version=3\n");
-    Router("manual");
-    RunOutOfMemory([&](const auto& fnArm) {
-        __tag_TAVO_ROUTERDB_LIST* pList = nullptr;
-        gStage.blOn = false;
-        fnArm();
-        TLibGetRouterDBList(&pList);
-        gNGoodAllocations = -1;
-        if (pList != nullptr) {
-            EXPECT_NE(pList->pNext, nullptr);  // whole or absent
-            TLibFreeRouterDBList(pList);
-        }
-        int nMax = 0;
-        std::string szPfpath;
-        fnArm();
-        RouterDB("192.168.1.1").GetMaxPorts(nMax);
-        RouterUpnpDB("B", "M", "1").GetPfpath(szPfpath);
-    });
-    gStage.blOn = true;
-    RunOutOfMemory([](const auto& fnArm) {
-        int nVersion = 0;
-        fnArm();
-        RouterUpnpDB::Update(nVersion);
-    });
-}
-
 TEST_F(Saving, AHashWithoutMemoryKeepsWhatItHas) {
     RunOutOfMemory([](const auto& fnArm) {
         TLIBCSzHash* pHash = TLIBCSzHashAlloc(0);

@@ -43,6 +43,14 @@ extern time_t gNClockAhead;
 extern int gNClockStep;
 extern time_t gNClockJumped;  // in all; a timer of the kernel does not know of it
 
+// Whoever lets the clock jump has one of these, so that it goes right for the tests that follow.
+struct JumpingClock {
+    JumpingClock() = default;
+    ~JumpingClock() { gNClockStep = 0, gNClockJumped = 0; }
+    JumpingClock(const JumpingClock&) = delete;
+    JumpingClock& operator=(const JumpingClock&) = delete;
+};
+
 // Memory runs out after so many allocations (never: negative), for one of them or for good.
 extern long gNGoodAllocations;
 extern bool gBlOneFailure;
