@@ -85,6 +85,23 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     EXPECT_EQ(reader.GetBrand(szText), 1);
     EXPECT_EQ(szText, "x\"; [10.0.0.1]\n");
 
+    EXPECT_EQ(reader.GetModel(szText), 1);
+    EXPECT_EQ(szText, "R1");
+    EXPECT_EQ(reader.GetVersion(szText), 1);
+    EXPECT_EQ(szText, "2");
+    EXPECT_EQ(DetectCacheReader("192.168.1.1").GetType(enState), 0);
+    EXPECT_EQ(DetectCacheWriter("192.168.1.1").SetType(static_cast<__TAG_TAVO_ROUTER_INIT_STATE>(4)), 0);
+    EXPECT_EQ(DetectCacheWriter("192.168.1.1").SetType(static_cast<__TAG_TAVO_ROUTER_INIT_STATE>(-1)), 0);
+    EXPECT_TRUE(Logged("error: invalid enume type enState=4"));
+    gStage.blOn = true;
+    for (const char* szFail : {"brand", "model", "version", "router_detect", "hash"}) {
+        gStage.szFail = szFail;
+        gStage.nWorks = 0;
+        EXPECT_EQ(SetDetectManualCache("192.168.1.1", "never", "kept", "3"), 0) << szFail;
+    }
+    gStage = Stage();
+    EXPECT_EQ(Read(SZF_DETECT_MANUAL_CACHE).find("never"), std::string::npos);
+
     DetectCacheReader other("10.0.0.1");
     EXPECT_EQ(other.IsSectionExisted(blExisted), 1);
     EXPECT_FALSE(blExisted);

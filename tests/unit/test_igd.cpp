@@ -14,6 +14,7 @@
 #include "tavo/core.h"
 #include "webserver.h"
 #include "wire/upnp/Description.h"
+#include "wire/upnp/GatewayMemory.h"
 #include "wire/upnp/Igd.h"
 #include "wire/upnp/Notify.h"
 #include "wire/upnp/Search.h"
@@ -538,6 +539,23 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
             tavo::HttpClient().Get({szHost, server.Port(), "/nobody"});
             EXPECT_NE(server.Request().find("/nobody"), std::string::npos) << "it was asked";
         }
+    }
+    {
+        // The one that is remembered, with the box's own address.
+        gSzGateway = kGateway;
+        WebServer server(szPage, kGateway);
+        const std::string szKnown = "http://192.168.77.1:" + std::to_string(server.Port()) + "/x";
+        tavo::KeepRouter(kGateway, {szKnown, true});
+        std::string szLocal;
+        EXPECT_NE(tavo::FindGatewayIgd(300, 0, &szLocal, {}), nullptr);
+        EXPECT_TRUE(szLocal.starts_with("192.168.77.")) << szLocal;
+        EXPECT_EQ(tavo::RecallRouter(kGateway).szLocation, szKnown);
+        EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
+        tavo::KeepRouter(kGateway, {"", false});
+        EXPECT_EQ(tavo::FindGatewayIgd(100, 0, nullptr, {}), nullptr);
+        gSzGateway = "";
+        EXPECT_EQ(tavo::FindGatewayIgd(30000, 0, nullptr, {}), nullptr);
+        gSzGateway = "192.168.1.1";
     }
     WebServer server(szPage, kGateway);
     std::atomic<bool> blEnd = false;

@@ -5,8 +5,11 @@
 #include <sys/stat.h>
 
 #include <cstring>
+#include <functional>
+#include <set>
 
 #include "libtavoportmap.h"
+#include "stage.h"
 #include "tavo/core.h"
 #include "tavo/portforward.h"
 #include "world.h"
@@ -180,6 +183,102 @@ TEST_F(Library, ARuleIsToldWholeOrNotAtAll) {
     gLog.clear();
     EXPECT_EQ(PF_CONF::GetRuleInfo(szText, blEnabled, szText, szText, szText, szText, szText, nullptr), 0);
     EXPECT_EQ(gLog, std::vector<std::string>{"pConf is NULL"});
+}
+
+TEST_F(Library, WhatIsMissingIsRefusedAndNamed) {
+    int nNumber = 0;
+    bool blAnswer = false;
+    char szNoName[] = "no separator";
+    std::string szA, szB, szC;
+    Rule* pRules = nullptr;
+    __tag_TAVO_ROUTER_CONF conf = {};
+    RouterDB db("192.168.1.1");
+    const std::tuple<std::function<int()>, int, const char*> rgCases[] = {
+        {[] { return TLibSupportEnumToString(nullptr, 8, TAVO_ROUTER_SUPPORT_NO); }, -1, "szOut is NULL"},
+        {[] { return TLibSupportStringToEnum(nullptr, "yes"); }, -1, "pEnSupport is NULL"},
+        {[] { return TLibGetLibTavoPortMapRunningTask(nullptr); }, -1, "enTask is NULL"},
+        {[] { return TLibGetGatewayIP(nullptr, 8); }, -1, "szOutGatewayIP is NULL"},
+        {[] { return TLibGetRouterDBList(nullptr); }, -1, "pplRouterDBList is NULL"},
+        {[] { return TLibFreeRouterDBList(nullptr); }, -1, "plRouterDBList is NULL"},
+        {[] { return TLibUpdateRouterDBList(nullptr); }, -1, "pnVersion is NULL"},
+        {[&] { return db.List(nullptr); }, 0, "pplRouterDBList is NULL"},
+        {[&] { return db.FreeList(nullptr); }, 0, "plRouterDBList is NULL"},
+        {[&] { return TLibGetRulesArrFromRuleConf(nullptr, &pRules, nullptr, false, nullptr); }, -1, "nPRules is NULL"},
+        {[&] { return TLibSetRouterConf("192.168.1.1", nullptr, nullptr, false); }, -1, "routerConf is NULL"},
+        {[&] { return TLibGetRouterConf("192.168.1.1", nullptr, nullptr, false); }, -1, "routerConf is NULL"},
+        {[&] { return TLibSetRouterConf("192.168.1.1", &conf, nullptr, false); }, -1,
+         "support_upnp shall not be empty"},
+        {[&] { return DETECT_INFO::fillRouterDetectResult(nullptr); }, -1, "detectResult is NULL"},
+        {[&] { return IsGenericRouterName(blAnswer, szNoName); }, 0, "incorrect information"},
+        {[&] { return IsGenericRouterName(blAnswer, nullptr); }, 0, "incorrect information"},
+        {[&] { return SplitRouterName(szNoName, szA, szB, szC); }, 0, "incorrect information"},
+        {[&] { return SplitRouterName(nullptr, szA, szB, szC); }, 0, "incorrect information"},
+        {[&] { return PF_CONF::IsRuleEnable(blAnswer, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::GetRuleID(szA, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::GetRuleServiceID(szA, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::ToArray(nNumber, nullptr, nullptr); }, 0, "pRgRules is NULL or *pRgRules is not NULL"},
+        {[&] { return PF_CONF::FreeArray(nullptr); }, 0, "pConfHead is NULL"},
+    };
+    for (const auto& [fnCall, nResult, szLine] : rgCases) {
+        gLog.clear();
+        EXPECT_EQ(fnCall(), nResult) << szLine;
+        EXPECT_TRUE(Logged(szLine)) << szLine;
+    }
+    EXPECT_EQ(szA + szB + szC, "");
+    nNumber = 7;
+    EXPECT_EQ(PF_CONF::ToArray(nNumber, &pRules, nullptr), 1);
+    EXPECT_EQ(nNumber, 0);
+    char szNamed[] = "N: M (1)";
+    char szGeneric[] = "N: M";
+    EXPECT_TRUE(IsGenericRouterName(blAnswer, szGeneric) && blAnswer);
+    EXPECT_TRUE(IsGenericRouterName(blAnswer, szNamed) && !blAnswer);
+    char szGateway[8] = "kept";
+    EXPECT_EQ(TLibGetGatewayIP(szGateway, 0), 0);
+    EXPECT_STREQ(szGateway, "kept");
+    EXPECT_EQ(TLibGetGatewayIP(szGateway, 8), 0);
+    EXPECT_STREQ(szGateway, "192.168");
+    gSzGateway = "";
+    EXPECT_EQ(TLibGetGatewayIP(szGateway, 8), -1);
+    EXPECT_TRUE(Logged("GetGatewayIP() failed"));
+    for (const char* szModel : {"A/B/1/router.des", "A/C/2/router.des"}) {
+        Write(std::string("/etc.defaults/portforward/routerdb/") + szModel, "[global]\n");
+    }
+    __tag_TAVO_ROUTERDB_LIST* pModels = nullptr;
+    EXPECT_EQ(TLibGetRouterDBList(&pModels), 1);
+    ASSERT_TRUE(pModels != nullptr && pModels->pNext != nullptr);
+    EXPECT_EQ(std::string(pModels->szBrand) + pModels->pNext->szBrand, "AA");
+    EXPECT_EQ(pModels->pNext->pNext, nullptr);
+    EXPECT_EQ(TLibFreeRouterDBList(pModels), 1);
+}
+
+// A test goes before a save; a daemon saves while its progress is marked, and only where it is not under test.
+TEST_F(Library, WhatRunsIsToldByWhoIsAliveAndWhatIsMarked) {
+    constexpr char kUnderTest[] = "/usr/tavo/sbin/upnpd --debug -p";
+    const std::tuple<std::set<std::string>, bool, int, int> rgCases[] = {
+        {{}, true, TAVO_LIBTAVOPORTMAP_TASK_IDLE, 0},
+        {{"tavoportforward"}, false, TAVO_LIBTAVOPORTMAP_TASK_SAVING, 1},
+        {{"upnpd"}, false, TAVO_LIBTAVOPORTMAP_TASK_IDLE, 0},
+        {{"upnpd"}, true, TAVO_LIBTAVOPORTMAP_TASK_SAVING, 1},
+        {{"natpmpd"}, false, TAVO_LIBTAVOPORTMAP_TASK_IDLE, 0},
+        {{"natpmpd"}, true, TAVO_LIBTAVOPORTMAP_TASK_SAVING, 1},
+        {{"upnpd", kUnderTest}, true, TAVO_LIBTAVOPORTMAP_TASK_TESTING, 0},
+        {{"testupnp.sh"}, true, TAVO_LIBTAVOPORTMAP_TASK_TESTING, 0},
+        {{"testupnp.sh", "tavoportforward"}, false, TAVO_LIBTAVOPORTMAP_TASK_TESTING, 1}};
+    for (const auto& [setAlive, blMarked, enTask, nSaving] : rgCases) {
+        gStage = Stage();
+        gStage.blOn = true;
+        gStage.alive = setAlive;
+        std::filesystem::remove("/tmp/pfProgress");
+        if (blMarked) {
+            Write("/tmp/pfProgress", "");
+        }
+        auto enFound = static_cast<__tag_TAVO_LIBTAVOPORTMAP_TASK>(7);
+        EXPECT_EQ(TLibGetLibTavoPortMapRunningTask(&enFound), 0);
+        EXPECT_EQ(enFound, enTask) << testing::PrintToString(setAlive);
+        EXPECT_EQ(IsSavingRules(), nSaving) << testing::PrintToString(setAlive);
+    }
+    gStage = Stage();
+    std::filesystem::remove("/tmp/pfProgress");
 }
 
 // Each call by itself, from the first allocation that fails on: it fails, and says so.

@@ -215,6 +215,29 @@ TEST(Notices, SinceSaysWhenAThingBecameAsItIs) {
     }
 }
 
+TEST(Notices, EachOutcomeHasItsReason) {
+    const std::tuple<const char*, PortState, bool, std::string> rgCases[] = {
+        {"1", PortState::kOpen, false, ""},
+        {"1", PortState::kOpen, true, "another program of this box made it"},
+        {"718", PortState::kRefused, true, "another program of this box has this port on the router"},
+        {"728", PortState::kRefused, false, "the router's table of ports is full"},
+        {"999", PortState::kRefused, false, "the router refuses it with error 999"},
+        {"9x", PortState::kRefused, false, "9x"},
+        {"", PortState::kRefused, false, ""}};
+    for (const auto& [szWord, enState, blOthers, szWhy] : rgCases) {
+        tavo::Verdict verdict{enState, szWord};
+        verdict.blOthers = blOthers;
+        EXPECT_EQ(tavo::WhyOf(verdict), szWhy) << szWord;
+        verdict.szWhy = "as it was";
+        EXPECT_EQ(tavo::WhyOf(verdict), "as it was");
+    }
+    tavo::RouterMapping mapping{"UDP", 65000, 1, "", "", 0, true};
+    EXPECT_EQ(tavo::MappingName(mapping), "65000/udp");
+    mapping.nMore = 535;
+    mapping.szProtocol = "BOTH";
+    EXPECT_EQ(tavo::MappingName(mapping), "65000-65535/both");
+}
+
 TEST(Notices, AHostileTextStaysAText) {
     const std::pair<std::string, std::string> rgTexts[] = {
         {"a\n\x1b[31m\x7f\"'$(x)\\", "a[31m\"'$(x)\\"},

@@ -305,6 +305,8 @@ TEST(NatpmpClient, AsksForWhatItIsToldTo) {
     const Peer peer([](int) { return std::vector<Bytes>{{0, 129, 0, 0, 0, 0, 0, 9, 0x13, 0x89, 0, 0, 0, 0, 0, 0}}; });
     EXPECT_EQ(tavo::NatpmpClient(kGateway, {}, {}, 300ms).Unmap("UDP", 0x1389), tavo::kWireOk);
     EXPECT_EQ(tavo::NatpmpClient("no address", {}, {}, 300ms).Unmap("UDP", 0x1389), tavo::kWireUnreachable);
+    EXPECT_EQ(tavo::NatpmpWords(2) + "; " + tavo::NatpmpWords(-1) + "; " + tavo::NatpmpWords(6),
+              "refused: not authorised; no answer from the gateway; refused: code 6");
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <climits>
+#include <functional>
 #include <numeric>
 #include <random>
 #include <set>
@@ -203,6 +204,56 @@ TEST_F(Relay, StoredRulesThatCannotBeRead) {
         EXPECT_EQ(gLog, c.lines);
         EXPECT_EQ(pOut, nullptr);
         EXPECT_EQ(nOut, 0);
+    }
+}
+
+TEST_F(Relay, WhatABuilderCannotWorkWithIsRefusedAndNamed) {
+    OPERATION_RULE opRule = {};
+    PortList ports;
+    __tag_TAVO_ROUTER_RULE stored = Stored("tcp", "1", "1", "", true);
+    const __tag_TAVO_PORTMAP_RULE request = Request("1", 0);
+    OPERATION_RULE* pHeld = &opRule;
+    __tag_TAVO_ROUTER_RULE* pHeldRules = &stored;
+    OPERATION_RULE* pOut = nullptr;
+    __tag_TAVO_ROUTER_RULE rgRoom[1] = {};
+    int nOut = 7, nWritten = 0;
+    const std::pair<std::function<int()>, const char*> rgCases[] = {
+        {[&] { return CreateOperationRulesArray(Host(), &pHeld, &nOut, "hop", &request, 1); },
+         "Bad parameter, rgOutRules is not NULL"},
+        {[&] { return CreateRulesArray(Host(), &pHeldRules, &nOut, nullptr, 0, nullptr, 0); },
+         "Bad parameter, rgRules is not NULL"},
+        {[&] { return CreateOperationRulesArray(Host(), &pOut, &nOut, &stored, -1); }, "0 > nRules=-1"},
+        {[&] {
+             return CreateOperationRulesArray(Host(), &pOut, &nOut, static_cast<__tag_TAVO_ROUTER_RULE*>(nullptr), 1);
+         },
+         "Bad parameter, rgRules is NULL"},
+        {[&] { return CreateOperationRulesArray(Host(), &pHeld, &nOut, &stored, 1); },
+         "Bad parameter, *pRgOutRules is not NULL"},
+        {[&] { return WriteRouterRules(Host(), &nWritten, rgRoom, 1, &opRule, 1); },
+         "rgOpRules[i].routerPortSet is NULL"},
+        {[&] { return opRule.routerPortSet = &ports, WriteRouterRules(Host(), &nWritten, rgRoom, 1, &opRule, 1); },
+         "rgOpRules[i].boxPortSet is NULL"}};
+    for (const auto& [fnCall, szLine] : rgCases) {
+        gLog.clear();
+        EXPECT_EQ(fnCall(), -1) << szLine;
+        EXPECT_TRUE(Logged(szLine)) << szLine;
+    }
+    EXPECT_EQ(nOut, 0) << "the last one clears its outputs";
+    EXPECT_STREQ(ToProtocolString(Host(), static_cast<PORTMAP_PROTOCOL>(3)), "");
+    EXPECT_TRUE(Logged("non support protocol enum"));
+    // Lists whose text leaves a byte free, fills a record, and goes beyond it.
+    for (const auto& [nLast, blFits] : {std::pair(20, true), {200, false}, {2000, false}}) {
+        PortList one;
+        for (int nPort = 10000; nPort < 10000 + 2 * 144; nPort += 2) {  // "10000, 10002, ...": 7 bytes for each
+            one.push_back(nPort);
+        }
+        one.push_back(60000);
+        one.push_back(600);
+        one.push_back(nLast);
+        OPERATION_RULE rule = {};
+        rule.routerPortSet = rule.boxPortSet = &one;
+        EXPECT_EQ(ToText(Host(), one)->size(), 1020U + std::to_string(nLast).size());
+        EXPECT_EQ(FitsRecord(Host(), rule), blFits) << nLast;
     }
 }
 
