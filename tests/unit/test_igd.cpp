@@ -567,11 +567,14 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
             poll(nullptr, 0, 10);
         }
     });
-    std::string szPlace = "http://192.168.77.1:1/gone";
-    EXPECT_NE(tavo::Igd::Find(kGateway, kBox, 5000, &szPlace), nullptr);
+    gSzGateway = kGateway;
+    tavo::KeepRouter(kGateway, {"http://192.168.77.1:1/gone", true});
+    EXPECT_NE(tavo::FindGatewayIgd(5000, 0, nullptr, {}), nullptr);
     blEnd = true;
     gateway.join();
-    EXPECT_TRUE(szPlace.ends_with("/found")) << szPlace;
+    gSzGateway = "192.168.1.1";
+    EXPECT_TRUE(tavo::RecallRouter(kGateway).szLocation.ends_with("/found")) << "what is found is kept";
+    EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
 }
 
 TEST(Notify, ALifeIsANumberOrAPlace) {

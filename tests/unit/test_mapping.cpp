@@ -783,6 +783,7 @@ TEST(Keeper, LooksSoonAfterAChangeAndSeldomInPeace) {
         const tavo::NextLook next = keeper.After(result, rgPasses[i].blChange, 120);
         EXPECT_EQ(std::pair(next.nSeconds, next.blLost), std::pair(rgPasses[i].nSeconds, rgPasses[i].blLost)) << i;
     }
+    EXPECT_EQ(tavo::Keeper().After({}, false, 120).nSeconds, 10) << "the first one";
     EXPECT_EQ(tavo::Keeper().After({}, true, 1).nSeconds, 1) << "never longer than the user wants it";
 }
 

@@ -249,8 +249,8 @@ TEST_F(RelayRouter, InitState) {
         std::erase(gLog, "file=/etc/portforward/router.conf not exists");
         EXPECT_EQ(gLog, c.lines);
     }
-    gSzGateway.clear();
     auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
+    gSzGateway.clear();
     EXPECT_EQ(GetInitState(&enState), -1);
     EXPECT_TRUE(Logged("get gateway ip failed"));
 }

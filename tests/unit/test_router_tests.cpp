@@ -180,6 +180,16 @@ TEST_F(RouterTests, EachStepThatFails) {
         {"ports stay closed", {{"open", 1}}, {}, 1, 17, 80, "TavoUpnpTestConnForAddedPorts() failed"},
         {"no end", {{"end", -1}}, {}, 1, 20, 90, "TavoUpnpTestTerminate() failed"},
     };
+    // What a user is shown of the steps that the library itself ends.
+    const std::map<std::string, std::pair<const char*, const char*>> mapShown = {
+        {"all pass", {"upnp_connection_success", "success"}},
+        {"add", {"upnp_add", "failed"}},
+        {"count", {"upnp_max", "-1"}},
+        {"delete", {"upnp_delete", "failed"}},
+        {"setup", {"upnp_connection_failed", "failed"}},
+        {"deleted ports stay open", {"upnp_connection_failed", "failed"}},
+        {"re-add", {"upnp_readd2", "failed"}},
+        {"ports stay closed", {"upnp_connection_success", "failed"}}};
     const std::vector<int> rgOrder = {10, 20, 30, 60, 40, 50, 70, 80, 90};
     for (const bool blNamed : {true, false}) {
         for (const StepCase& step : rgCases) {
@@ -207,6 +217,11 @@ TEST_F(RouterTests, EachStepThatFails) {
                 return szSeen.starts_with(step.szLine);
             }));
             EXPECT_EQ(Logged("fillTestCompResult() failed"), !blNamed);
+            if (const auto shown = mapShown.find(step.szWhat); shown != mapShown.end()) {
+                char szWord[20] = {};
+                TLIBCFileGetKeyValue("/tmp/upnp_test.progress", shown->second.first, szWord, sizeof(szWord), 0);
+                EXPECT_STREQ(szWord, shown->second.second);
+            }
         }
     }
 }
@@ -226,6 +241,14 @@ TEST_F(RouterTests, APassedTestInItsOrder) {
     EXPECT_EQ(mClient.rgszCalls, (Lines{"add", "count", "delete", "setup", "closed", "modify", "open", "end"}));
     EXPECT_EQ(gNSlept, 7 * 4);  // seven steps are waited for
     EXPECT_EQ(gLog, Lines());
+    for (const TAVO_UPNP_GATEWAY_MODEL& model :
+         {TAVO_UPNP_GATEWAY_MODEL{"A", "", ""}, TAVO_UPNP_GATEWAY_MODEL{"", "B", ""},
+          TAVO_UPNP_GATEWAY_MODEL{"", "", "C"}}) {
+        mNetwork.model = model;
+        result.szSupport[0] = '\0';
+        EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), 0);
+        EXPECT_STREQ(result.szSupport, "yes") << "one word names it well enough";
+    }
 }
 
 TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
