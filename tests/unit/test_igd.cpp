@@ -436,12 +436,12 @@ protected:
 };
 
 TEST_F(SearchTest, AsksForEachKindAgainAndAgainUntilItsLimit) {
-    for (const auto& [nMilliseconds, nAskings] : {std::pair(100, 1U), {400, 2U}, {900, 3U}}) {
+    for (const auto& [nMilliseconds, nAskings] : {std::pair(100, 1U), {400, 2U}, {1100, 3U}}) {
         mRgszTargets.clear();
         const auto start = std::chrono::steady_clock::now();
         EXPECT_FALSE(Search(nMilliseconds, [this] { Hear(); }));
         const auto took = std::chrono::steady_clock::now() - start;
-        EXPECT_TRUE(took >= nMilliseconds * 1ms && took < nMilliseconds * 1ms + 500ms) << took / 1ms;
+        EXPECT_TRUE(took >= nMilliseconds * 1ms && took < nMilliseconds * 1ms + 2s) << took / 1ms;
         EXPECT_EQ(mRgszTargets.size(), 4 * nAskings) << nMilliseconds;
         EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), 4U);
     }

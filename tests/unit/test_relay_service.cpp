@@ -306,14 +306,6 @@ TEST_F(RelayService, EachStepThatFails) {
          1,
          {"file=/etc/portforward/router.conf not exists", "Not initialized portforwarding"},
          false},
-        {"an odd cache",
-         [] {
-             std::filesystem::remove(kRouterConf);
-             Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"odd\"\n");
-         },
-         1,
-         {"invalid szValue=odd", "Not initialized portforwarding"},
-         false},
         {"a cache of the unknown",
          [] {
              std::filesystem::remove(kRouterConf);
@@ -326,12 +318,6 @@ TEST_F(RelayService, EachStepThatFails) {
          [] { Write(kRouterConf, Conf("R1", "no", "no")); },
          -1,
          {"Can not set rules for manual router"},
-         false},
-        {"a rule without ports",
-         [] { Write(kRuleConf, "[1]\nenabled=\"1\"\nprotocol name=\"tcp\"\n"); },
-         -1,
-         {"get rule src port failed", "GetRulePort() failed", "PF_CONF::ToArray() failed",
-          "TLibGetRulesArrFromRuleConf() failed"},
          false},
         {"a rule of another protocol",
          [] { Write(kRuleConf, Stored("E TCP 80 80")); },
@@ -365,11 +351,6 @@ TEST_F(RelayService, EachStepThatFails) {
          {"can not sync rules to file", "save rule failed"},
          false},
         {"no daemon", [] { gStage.szFail = "exec"; }, -1, {"upnp daemon start failed", "save rule failed"}, true},
-        {"a refusing router",
-         [] { Write("/var/tmp/upnp_portmap.status", "82/tcp=718\n"); },
-         -1,
-         {"upnp port conflict", "save rule failed"},
-         true},
         {"no tester",
          [this] { mClient.mapAnswers["init"] = -1; },
          -1,
