@@ -536,6 +536,10 @@ TEST_F(Detection, SettingsAfterEachFault) {
          1},
         {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty", true, 1},
         {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed", true, 1},
+        {"a type that cannot be kept", [](RouterConf&) { gStage.blOn = true, gStage.szFail = "conn_type"; },
+         "save config failed", true, 1},
+        {"a port that cannot be kept", [](RouterConf&) { gStage.blOn = true, gStage.szFail = "conn_port"; },
+         "save config failed", true, 1},
         {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
          "can not save backup file of '/etc/portforward/router.conf.bak'", true, 1},
         {"failed write", [](RouterConf&) { gFnOnConfSet = [] { return -1; }; }, "sync config failed", true, 1},
@@ -569,6 +573,7 @@ TEST_F(Detection, SettingsAfterEachFault) {
             TLibTavoPortMapUnLock();
         }
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+        gStage = Stage();
         TearDown();
     }
     // What an earlier failed restore left comes back after a failed write of a UPnP router.
