@@ -328,6 +328,17 @@ TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
     gFnOnConfSet = nullptr;
 }
 
+// A save that died between its renaming and its writing: "no rules" would close every port.
+TEST_F(Faults, RulesComeBackWhoeverHasThemLocked) {
+    const std::string szCopy = std::string(kRuleConf) + "aB3dE6";
+    Write(szCopy, "[1]\nenabled=1\n");
+    const tavo::Descriptor fdForeign(open(szCopy.c_str(), O_RDONLY | O_CLOEXEC));
+    struct flock lock = {};
+    lock.l_type = F_RDLCK;
+    ASSERT_EQ(fcntl(fdForeign.Get(), F_OFD_SETLK, &lock), 0);
+    EXPECT_EQ(CountRules(), 1);
+}
+
 // Whoever may read the settings may lock them too: he is in the way of nobody who stores or reports. Who may write them
 // can: what cannot be held could be brought back too soon, and be packed with the password in it.
 TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
