@@ -216,17 +216,14 @@ TEST(Notices, SinceSaysWhenAThingBecameAsItIs) {
 }
 
 TEST(Notices, EachOutcomeHasItsReason) {
-    const std::tuple<const char*, PortState, bool, std::string> rgCases[] = {
-        {"1", PortState::kOpen, false, ""},
-        {"1", PortState::kOpen, true, "another program of this box made it"},
-        {"718", PortState::kRefused, true, "another program of this box has this port on the router"},
-        {"728", PortState::kRefused, false, "the router's table of ports is full"},
-        {"999", PortState::kRefused, false, "the router refuses it with error 999"},
-        {"9x", PortState::kRefused, false, "9x"},
-        {"", PortState::kRefused, false, ""}};
-    for (const auto& [szWord, enState, blOthers, szWhy] : rgCases) {
+    const std::tuple<const char*, PortState, std::string> rgCases[] = {
+        {"1", PortState::kOpen, ""},
+        {"728", PortState::kRefused, "the router's table of ports is full"},
+        {"999", PortState::kRefused, "the router refuses it with error 999"},
+        {"9x", PortState::kRefused, "9x"},
+        {"", PortState::kRefused, ""}};
+    for (const auto& [szWord, enState, szWhy] : rgCases) {
         tavo::Verdict verdict{enState, szWord};
-        verdict.blOthers = blOthers;
         EXPECT_EQ(tavo::WhyOf(verdict), szWhy) << szWord;
         verdict.szWhy = "as it was";
         EXPECT_EQ(tavo::WhyOf(verdict), "as it was");
