@@ -331,7 +331,7 @@ TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
 // A save that died between its renaming and its writing: "no rules" would close every port.
 TEST_F(Faults, RulesComeBackWhoeverHasThemLocked) {
     const std::string szCopy = std::string(kRuleConf) + "aB3dE6";
-    Write(szCopy, "[1]\nenabled=1\n");
+    Write(szCopy, kOldRules);
     const tavo::Descriptor fdForeign(open(szCopy.c_str(), O_RDONLY | O_CLOEXEC));
     struct flock lock = {};
     lock.l_type = F_RDLCK;
