@@ -18,6 +18,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <iterator>
+#include <memory>
 #include <string_view>
 #include <utility>
 
@@ -165,7 +166,7 @@ bool EndRunning(const DaemonNames& names, int nSignal) {
 
 class Frame {
 public:
-    explicit Frame(Mapper& mapper) : mNames(mapper.Names()), mMapper(mapper) {
+    Frame(const DaemonNames& names, Mapper& mapper) : mNames(names), mMapper(mapper) {
         mFdEvents.Reset(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
         inotify_add_watch(mFdEvents.Get(), kMarkerDir, IN_CREATE | IN_MOVED_TO);
     }
@@ -274,14 +275,16 @@ int AnotherRuns(const DaemonNames& names) {
     return 1;
 }
 
-int RunInstance(Mapper& mapper, Descriptor& fdReady) {
-    const DaemonNames& names = mapper.Names();
+// The mapper reads what the one before it has left, be that another program or a child that crashed: not before this
+// process is the one instance.
+int RunInstance(const DaemonNames& names, const MakeMapper& fnMake, Descriptor& fdReady) {
     Instance instance(names.szLockFile);
     if (!instance.Take()) {
         return AnotherRuns(names);
     }
     MakeLockFiles();
-    Frame frame(mapper);
+    const std::unique_ptr<Mapper> pMapper = fnMake();
+    Frame frame(names, *pMapper);
     WritePidFile(names);
     const bool blTold = fdReady.Get() < 0 || write(fdReady.Get(), "r", 1) == 1;
     SysLog(LOG_INFO, "%s begins%s", names.szName, blTold ? "" : " anew");
@@ -291,8 +294,7 @@ int RunInstance(Mapper& mapper, Descriptor& fdReady) {
     return 0;
 }
 
-int RunInBackground(Mapper& mapper, char* szTitle) {
-    const DaemonNames& names = mapper.Names();
+int RunInBackground(const DaemonNames& names, const MakeMapper& fnMake, char* szTitle) {
     const Instance instance(names.szLockFile);
     if (instance.Holder() != 0) {
         return AnotherRuns(names);
@@ -303,23 +305,22 @@ int RunInBackground(Mapper& mapper, char* szTitle) {
         return WaitUntil(kStartLimit, [&] { return instance.Holder() != 0; }) ? 0 : 1;
     }
     Descriptor fdReady = Detach();
-    return Watch(names.szName, szTitle).Run([&] { return RunInstance(mapper, fdReady); });
+    return Watch(names.szName, szTitle).Run([&] { return RunInstance(names, fnMake, fdReady); });
 }
 
-int StopRunning(Mapper& mapper) {
-    const DaemonNames& names = mapper.Names();
+int StopRunning(const DaemonNames& names, const MakeMapper& fnMake) {
     Instance instance(names.szLockFile);
     bool blGone = true;
     if (instance.Take()) {  // nobody ran; one that was killed may have left its mappings
-        blGone = !mapper.IsSwitchedOn() || Withdraw(mapper);
+        const std::unique_ptr<Mapper> pMapper = fnMake();
+        blGone = !pMapper->IsSwitchedOn() || Withdraw(*pMapper);
         unlink(names.szPidFile);
         instance.Forget();
     }
     return EndRunning(names, SIGTERM) && blGone ? 0 : 1;
 }
 
-int RunDaemon(Mapper& mapper, std::string_view szOptions, char* szTitle) {
-    const DaemonNames& names = mapper.Names();
+int RunDaemon(const DaemonNames& names, const MakeMapper& fnMake, std::string_view szOptions, char* szTitle) {
     openlog(names.szName, LOG_PID | (szOptions == "--stop " ? LOG_PERROR : 0), LOG_DAEMON);
     if (geteuid() != 0) {
         std::fprintf(stderr, "%s: only root can do this: run it with sudo\n", names.szName);
@@ -329,16 +330,16 @@ int RunDaemon(Mapper& mapper, std::string_view szOptions, char* szTitle) {
         return MakeLockFiles();
     }
     if (szOptions.empty()) {
-        return RunInBackground(mapper, szTitle);
+        return RunInBackground(names, fnMake, szTitle);
     }
     if (szOptions == "--stop ") {
-        return StopRunning(mapper);
+        return StopRunning(names, fnMake);
     }
     if (szOptions != "--foreground " && !EndRunning(names, SIGUSR1)) {
         return 1;
     }
     Descriptor fdReady;
-    return szOptions == "--hand-over " ? 0 : RunInstance(mapper, fdReady);
+    return szOptions == "--hand-over " ? 0 : RunInstance(names, fnMake, fdReady);
 }
 
 void PrintHelp(FILE* pOut, const DaemonNames& names) {
@@ -347,23 +348,23 @@ void PrintHelp(FILE* pOut, const DaemonNames& names) {
 
 }  // namespace
 
-int DaemonMain(int argc, char** argv, Mapper& mapper) {
+int DaemonMain(int argc, char** argv, const DaemonNames& names, const MakeMapper& fnMake) {
     std::string szOptions;
     for (int i = 1; i < argc; ++i) {
         szOptions += std::string(argv[i]) + " ";
     }
     if (szOptions == "--help ") {
-        PrintHelp(stdout, mapper.Names());
+        PrintHelp(stdout, names);
         return 0;
     }
     constexpr std::string_view kOptions[] = {"",        "--foreground ", "--foreground --take-over ",
                                              "--stop ", "--hand-over ",  "--make-locks "};
     if (std::find(std::begin(kOptions), std::end(kOptions), szOptions) == std::end(kOptions)) {
-        std::fprintf(stderr, "%s: unknown arguments '%s'\n\n", mapper.Names().szName, szOptions.c_str());
-        PrintHelp(stderr, mapper.Names());
+        std::fprintf(stderr, "%s: unknown arguments '%s'\n\n", names.szName, szOptions.c_str());
+        PrintHelp(stderr, names);
         return kExitUsage;
     }
-    return RunDaemon(mapper, szOptions, argv[0]);
+    return RunDaemon(names, fnMake, szOptions, argv[0]);
 }
 
 }  // namespace tavo

@@ -6,6 +6,7 @@
 #pragma once
 
 #include <functional>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -23,7 +24,6 @@ struct DaemonNames {
 class Mapper {
 public:
     virtual ~Mapper() = default;
-    virtual const DaemonNames& Names() const = 0;
     // One pass: reads the settings anew when blRequested (a start or a SIGHUP, as against the clock),
     // brings the router in line and writes the results. fnStop: whether to end early. Seconds until the
     // next pass.
@@ -40,9 +40,12 @@ public:
     virtual bool OnNetworkChange() = 0;
 };
 
-// A daemon's whole main(): arguments, the way into the background, then the mapper until SIGTERM, SIGINT or
+// Called in the process that does the work, once it is the one instance: again after each crash.
+using MakeMapper = std::function<std::unique_ptr<Mapper>()>;
+
+// A daemon's whole main(): arguments, the way into the background, then a mapper until SIGTERM, SIGINT or
 // SIGUSR1. Exit status: 0; 1 when another instance runs, or what was asked for could not be done; 2 for a wrong
 // argument.
-int DaemonMain(int argc, char** argv, Mapper& mapper);
+int DaemonMain(int argc, char** argv, const DaemonNames& names, const MakeMapper& fnMake);
 
 }  // namespace tavo

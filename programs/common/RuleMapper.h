@@ -28,7 +28,6 @@ namespace tavo {
 
 class RuleMapper : public Mapper {
 public:
-    const DaemonNames& Names() const final { return mNames; }
     int Run(bool blRequested, const std::function<bool()>& fnStop) final;
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
     bool Withdraw(const std::function<bool()>& fnStop) final;

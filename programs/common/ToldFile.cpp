@@ -124,12 +124,4 @@ Told ParseTold(const std::string& szText) {
     return told;
 }
 
-Told& ToldFile::Get() {
-    if (!mBlRead) {
-        mTold = ParseTold(mFile.Read());
-        mBlRead = true;
-    }
-    return mTold;
-}
-
 }  // namespace tavo

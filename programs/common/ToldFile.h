@@ -16,14 +16,13 @@ class ToldFile {
 public:
     // szDaemon: "upnpd", "natpmpd".
     explicit ToldFile(const std::string& szDaemon)
-        : mFile("/var/lib/tavo/" + szDaemon + ".told", "what was told may be told again") {}
-    // Read when it is first asked for: until then another daemon, whose place this one takes, may write it.
-    Told& Get();
-    void Save() { mFile.Save(FormatTold(Get())); }
+        : mFile("/var/lib/tavo/" + szDaemon + ".told", "what was told may be told again"),
+          mTold(ParseTold(mFile.Read())) {}
+    Told& Get() { return mTold; }
+    void Save() { mFile.Save(FormatTold(mTold)); }
 
 private:
     StateFile mFile;
-    bool mBlRead = false;
     Told mTold;
 };
 

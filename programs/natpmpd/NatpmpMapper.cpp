@@ -12,13 +12,6 @@ namespace tavo {
 
 namespace {
 
-constexpr DaemonNames kNames{"natpmpd",
-                             "NAT-PMP",
-                             "runnatpmpportmapping",
-                             "/var/run/natpmpd.pid",
-                             "/var/run/natpmpd.lock",
-                             "/var/tmp/natpmp_portmap.remap"};
-
 // Of words that both daemons use, what they mean here.
 constexpr std::pair<std::string_view, const char*> kCommonWords[] = {
     {"nogateway", "no gateway"}, {"busy", "upnpd has not taken its mappings away yet"}};
@@ -40,7 +33,14 @@ RouterState StateOf(Reply enReply) {
 
 }  // namespace
 
-NatpmpMapper::NatpmpMapper() : RuleMapper(kNames), mMade(kMadeFile) {}
+constexpr DaemonNames kNatpmpNames{"natpmpd",
+                                   "NAT-PMP",
+                                   "runnatpmpportmapping",
+                                   "/var/run/natpmpd.pid",
+                                   "/var/run/natpmpd.lock",
+                                   "/var/tmp/natpmp_portmap.remap"};
+
+NatpmpMapper::NatpmpMapper() : RuleMapper(kNatpmpNames), mMade(kMadeFile) {}
 
 // What was made here before is as doubtful as what was read from the file.
 void NatpmpMapper::NewGateway() {

@@ -14,6 +14,8 @@
 
 namespace tavo {
 
+extern const DaemonNames kNatpmpNames;
+
 class NatpmpMapper : public RuleMapper {
 public:
     NatpmpMapper();

@@ -13,8 +13,6 @@ namespace tavo {
 
 namespace {
 
-constexpr DaemonNames kNames{
-    "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
 constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
 constexpr char kNoIgd[] = "noigd";
 constexpr int kDiscoveryMilliseconds = 8000;
@@ -23,7 +21,10 @@ constexpr auto kEcho = std::chrono::seconds(3);  // until what we have changed h
 
 }  // namespace
 
-UpnpMapper::UpnpMapper() : RuleMapper(kNames), mMade(kMadeFile) {}
+constexpr DaemonNames kUpnpNames{
+    "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
+
+UpnpMapper::UpnpMapper() : RuleMapper(kUpnpNames), mMade(kMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();

@@ -14,6 +14,8 @@
 
 namespace tavo {
 
+extern const DaemonNames kUpnpNames;
+
 class UpnpMapper : public RuleMapper {
 public:
     UpnpMapper();

@@ -2,6 +2,7 @@
 // Relies on the frame of the daemons and on UpnpMapper, or on TestDaemon. Promises: one instance of each;
 // see --help.
 #include <cstring>
+#include <memory>
 
 #include "programs/common/Daemon.h"
 #include "programs/upnpd/TestDaemon.h"
@@ -11,6 +12,5 @@ int main(int argc, char** argv) {
     if (argc == 3 && std::strcmp(argv[1], "--debug") == 0 && std::strcmp(argv[2], "-p") == 0) {
         return tavo::TestDaemon().Run();
     }
-    tavo::UpnpMapper mapper;
-    return tavo::DaemonMain(argc, argv, mapper);
+    return tavo::DaemonMain(argc, argv, tavo::kUpnpNames, [] { return std::make_unique<tavo::UpnpMapper>(); });
 }

@@ -160,6 +160,7 @@ class World(unittest.TestCase):
         LAB.start_scripted("rewrites")
         self.assertEqual(LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")["status"], 0)
         wait_for(lambda: LAB.scripted()["count"]["AddPortMapping"] > 2, 15, "leases are renewed")
+        os.kill(LAB.daemon_pid(), signal.SIGKILL)  # its parent starts it again
         self.assertEqual(LAB.save("2,1,tcp,5002,5002")["status"], 0)
         self.assertEqual([row[1] for row in LAB.scripted()["table"]], [5002])
 

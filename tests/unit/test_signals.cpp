@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <memory>
 
 #include "programs/common/Daemon.h"
 #include "programs/common/Instance.h"
@@ -54,7 +55,6 @@ class PlayedMapper : public tavo::Mapper {
 public:
     using OnPass = std::function<void(int)>;
     explicit PlayedMapper(OnPass fnOnPass) : mFnOnPass(std::move(fnOnPass)) {}
-    const tavo::DaemonNames& Names() const override { return kNames; }
     int Run(bool blRequested, const std::function<bool()>& fnStop) override {
         mFnOnPass(++mNPasses);
         Tell(std::string(blRequested ? "request" : "clock") + (fnStop() ? " cut" : " whole"));
@@ -103,10 +103,13 @@ int InChild(const std::function<int()>& fnRun) {
     return WIFEXITED(nStatus) ? WEXITSTATUS(nStatus) : -1;
 }
 
-int RunPlayed(PlayedMapper& mapper, std::string szOption = "--foreground", std::string szSecond = "") {
+int RunPlayed(const PlayedMapper& mapper, std::string szOption = "--foreground", std::string szSecond = "") {
     char szName[] = "played";
     char* rgszArguments[] = {szName, szOption.data(), szSecond.data(), nullptr};
-    return DaemonMain(szOption.empty() ? 1 : szSecond.empty() ? 2 : 3, rgszArguments, mapper);
+    return tavo::DaemonMain(szOption.empty()   ? 1
+                            : szSecond.empty() ? 2
+                                               : 3,
+                            rgszArguments, kNames, [&] { return std::make_unique<PlayedMapper>(mapper); });
 }
 
 TEST(Daemon, PassesFollowTheirSignals) {
