@@ -72,7 +72,10 @@ Verdict RefusedBy(const RouterReply& reply) {
 }
 
 Outcome OutcomeOf(const RouterMapping& mapping, Verdict verdict) {
-    return {MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort};
+    Outcome outcome{MappingName(mapping), std::move(verdict), mapping.szProtocol, mapping.nRouterPort,
+                    mapping.nBoxPort};
+    outcome.szClient = mapping.szClient;
+    return outcome;
 }
 
 std::string WhyOf(const Verdict& verdict) {

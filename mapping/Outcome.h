@@ -57,8 +57,9 @@ struct Outcome {
     uint16_t nRouterPort = 0;
     uint16_t nBoxPort = 0;
     std::string szRule = {};
-    time_t nSince = 0;        // how long it has been so, in the box's own time of day
-    bool blLeftOver = false;  // no rule asks for it, and the router did not take it away
+    time_t nSince = 0;          // how long it has been so, in the box's own time of day
+    bool blLeftOver = false;    // no rule asks for it, and the router did not take it away
+    std::string szClient = {};  // the address that it leads to; empty: this box's
 };
 using OutcomeList = std::vector<Outcome>;
 

@@ -58,7 +58,7 @@ Json::Value RuleRow(const Outcome& outcome, time_t nAt) {
 Json::Value LeftOverRow(const Outcome& outcome, const Published& state) {
     Json::Value js;
     js["name"] = outcome.szName;
-    js["address"] = TextOrNull(state.szBox);
+    js["address"] = TextOrNull(outcome.szClient.empty() ? state.szBox : outcome.szClient);
     js["why"] = WhyOf(outcome.verdict);
     js["until"] = Until(outcome.verdict, state.nAt);
     return js;

@@ -95,7 +95,8 @@ class World(unittest.TestCase):
         try:
             wait_for(lambda: "former address" in LAB.read(published), 10, "what is waited for is said")
             self.assertNotEqual(LAB.save("2,1,tcp,5002,5002")["result"], 0, "5001 is still open")
-            self.assertEqual([row["name"] for row in json.loads(LAB.read(published))["left_over"]], ["5001/tcp"])
+            self.assertEqual([(row["name"], row["address"]) for row in json.loads(LAB.read(published))["left_over"]],
+                             [("5001/tcp", BOX)], "the former address, as it leads there")
             wait_for(lambda: LAB.mappings() == {("tcp", 5002): (NEW, 5002)}, 40, "it leads to the new address")
             LAB.stop_daemon(signal.SIGTERM)
             self.assertEqual(LAB.mappings(), {})
