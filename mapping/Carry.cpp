@@ -84,7 +84,8 @@ void Carrier::TakeAway(const PlaceList& rgpPlaces) {
             return;
         }
         const Step step = mPlaces.StepFor(*pPlace);
-        if (step.enAction == Action::kRemove || step.enAction == Action::kReplace) {
+        const bool blAway = step.enAction == Action::kRemove || step.enAction == Action::kReplace;
+        if (blAway && !mPlaces.IsOthers(*pPlace)) {
             const RouterMapping gone = mPlaces.Known(*pPlace);
             if (Remove(*pPlace)) {
                 mPlaces.around.fnTell(gone, step);

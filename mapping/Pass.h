@@ -35,6 +35,8 @@ struct Surroundings {
     std::function<bool()> fnSave;  // puts the record where it survives us; whether it is there
     // Is told of each step that changes something at the router, and why.
     std::function<void(const RouterMapping&, const Step&)> fnTell = [](const RouterMapping&, const Step&) {};
+    // What another daemon of this box sees to, by place the port of the box: what leads there is not taken away.
+    std::map<MappingKey, uint16_t> mapOthers = {};
 };
 
 struct PassResult {

@@ -61,6 +61,11 @@ bool Places::IsServed(const Place& place) const {
     return place.enSeen == Seen::kPresent && Serves(place.entry, *place.pWanted, around.szBox);
 }
 
+bool Places::IsOthers(const Place& place) {
+    const auto it = around.mapOthers.find(place.key);
+    return it != around.mapOthers.end() && it->second == Known(place).nBoxPort;
+}
+
 RouterMapping Places::Known(const Place& place) {
     const Made* pMade = MadeAt(place);
     if (pMade == nullptr || (place.enSeen == Seen::kPresent && !place.entry.szProtocol.empty())) {

@@ -37,6 +37,7 @@ struct Places {
     Made* MadeAt(const Place& place);  // our record of it; null: there is none
     Step StepFor(const Place& place);
     bool IsServed(const Place& place) const;  // it is there, and leads where it is wanted to
+    bool IsOthers(const Place& place);        // another daemon of this box has it lead where it leads
     // What is known of what is at a place: what the router shows, else what was asked for.
     RouterMapping Known(const Place& place);
 

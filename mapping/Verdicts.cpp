@@ -35,7 +35,7 @@ void AddLeftOver(Places& places, const Place& place) {
     const bool blThere = place.enSeen == Seen::kPresent && IsOurs(place.entry, pMade, places.around.szBox);
     // What a form still has of before is there beside what is wanted.
     const bool blBeside = places.what.blForm && !place.kept.IsOk();
-    if ((place.pWanted != nullptr && !blBeside) || (!blThere && pMade == nullptr)) {
+    if ((place.pWanted != nullptr && !blBeside) || (!blThere && pMade == nullptr) || places.IsOthers(place)) {
         return;
     }
     const RouterMapping left = places.Known(place);

@@ -2,6 +2,7 @@
 // text; no file. Promises: the first rule that asks for a port has it; each outcome has a name of its own.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -26,6 +27,8 @@ struct WantedSet {
     OutcomeList rgRefused;
     bool blReadable = true;
     bool blSwitchedOn = false;  // else nothing is wanted, whatever the rules say
+    // Where it is not: what the rules ask of the other daemon; none where they cannot be read.
+    std::optional<std::vector<RouterMapping>> rgOthers = {};
 };
 
 // Of the rules that are in force.

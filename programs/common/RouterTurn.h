@@ -1,5 +1,7 @@
 // Whose turn it is at the router. The two daemons may ask one router for one and the same mapping; were
 // one still taking its own away while the other makes its own, a mapping just made would vanish.
+// What is on record of one that is switched off, and no rule asks for, goes without a turn, too: the router may have
+// been away when it had its turn, or it has crashed.
 // Relies on FileLock: a daemon that is killed gives its turn back. Promises: bounded waiting.
 #pragma once
 

@@ -21,9 +21,7 @@ bool IsRunKeyOn(const char* szRunKey) {
 }
 
 WantedSet ReadWanted(const char* szRunKey) {
-    if (!IsRunKeyOn(szRunKey)) {
-        return {};
-    }
+    const bool blSwitchedOn = IsRunKeyOn(szRunKey);
     const ConfList pRules(TAVOPFRuleGet());
     const bool blReadable =
         pRules != nullptr || TLIBCErrGet() == TLIBC_ERR_NONE || TLIBCErrGet() == TLIBC_ERR_NOT_FOUND;
@@ -34,6 +32,11 @@ WantedSet ReadWanted(const char* szRunKey) {
         }
     }
     WantedSet wanted = Expand(rgRules);
+    if (!blSwitchedOn) {
+        WantedSet none;
+        none.rgOthers = blReadable ? std::make_optional(std::move(wanted.rgMappings)) : std::nullopt;
+        return none;
+    }
     wanted.blReadable = blReadable;
     wanted.blSwitchedOn = true;
     return wanted;

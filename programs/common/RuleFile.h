@@ -10,7 +10,7 @@ namespace tavo {
 // Whether szRunKey of the system settings is "yes".
 bool IsRunKeyOn(const char* szRunKey);
 
-// Nothing when szRunKey of the system settings is not "yes".
+// Nothing, and what is the other daemon's, when szRunKey of the system settings is not "yes".
 WantedSet ReadWanted(const char* szRunKey);
 
 RuleText RuleTextOf(const TAVO_PF_CONF* pRule);

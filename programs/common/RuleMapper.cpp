@@ -23,7 +23,8 @@ namespace {
 constexpr mode_t kResultMode = 0644;
 constexpr int kRetrySeconds = 10;  // until a run key that could not be mended is tried again
 constexpr int kWithdrawTries = 3;
-constexpr auto kTurnLimit = std::chrono::seconds(60);  // the other daemon takes its mappings away meanwhile
+constexpr auto kTurnLimit = std::chrono::seconds(60);     // the other daemon takes its mappings away meanwhile
+constexpr auto kLastTurnLimit = std::chrono::seconds(5);  // at the end: the other daemon may be ending, too
 constexpr size_t kAddressSize = 16;
 constexpr int kPassesToOutside = 5;
 constexpr char kNoAddress[] = "0.0.0.0";  // how a router says that it has none
@@ -103,8 +104,7 @@ bool RuleMapper::FindGateway() {
     return blFound;
 }
 
-// A daemon that is switched off and does not have the turn has nothing at the router to take away: it
-// gave the turn back only after that.
+// One that is switched off does not wait: it has its own taken away without the turn.
 bool RuleMapper::TakeTurn(const std::function<bool()>& fnStop) {
     const auto end = BootClock::now() + kTurnLimit;
     return mTurn.Take([&] { return IsSwitchedOn() && !fnStop() && BootClock::now() < end; });
@@ -137,9 +137,25 @@ PassResult RuleMapper::Failed(const std::vector<RouterMapping>& rgWanted, const 
     return result;
 }
 
+// What is ours goes also while the other daemon has the turn: it need not wait for a router that was away when the turn
+// was ours, nor for us when we have crashed. But what the rules ask for is the other's by now, and may be one and the
+// same mapping at the router: that one stays, on our record, for as long as a rule asks for it.
+PassResult RuleMapper::TakeAwayBesides(const std::vector<RouterMapping>& rgOthers,
+                                       const std::function<bool()>& fnStop) {
+    for (const RouterMapping& other : rgOthers) {
+        mMapOthers.emplace(KeyOf(other), other.nBoxPort);
+    }
+    PassResult result = Map({}, false, fnStop);
+    mMapOthers.clear();
+    return result;
+}
+
 PassResult RuleMapper::Pass(bool blRequested, const std::function<bool()>& fnStop) {
     if (!TakeTurn(fnStop)) {
         const bool blSwitchedOn = IsSwitchedOn();
+        if (!blSwitchedOn && mWanted.rgOthers && FindGateway() && HasMade(fnStop)) {
+            return TakeAwayBesides(*mWanted.rgOthers, fnStop);
+        }
         PassResult result =
             Failed(mWanted.rgMappings, "busy", blSwitchedOn ? RouterState::kBusy : RouterState::kNotAsked);
         result.transport = {blSwitchedOn ? Reply::kTimeout : Reply::kOk};
@@ -271,11 +287,20 @@ void RuleMapper::TellNews(const Published& state, bool blRequested) {
 
 bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
     Unpublish(mNames.szName);
-    if (!mTurn.Take([] { return false; })) {
-        return true;  // without the turn, nothing was made
+    bool blTurn = mTurn.Take([] { return false; });
+    if (!blTurn) {
+        if (!FindGateway() || !HasMade(fnStop)) {
+            return true;
+        }
+        const auto end = BootClock::now() + kLastTurnLimit;
+        blTurn = mTurn.Take([&] { return !fnStop() && BootClock::now() < end; });
     }
+    if (!blTurn && !mWanted.blSwitchedOn && !mWanted.rgOthers) {
+        return false;  // nobody knows what is the other's
+    }
+    const std::vector<RouterMapping> rgOthers = mWanted.rgOthers.value_or(mWanted.rgMappings);
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
-        const PassResult result = Map({}, false, fnStop);
+        const PassResult result = blTurn ? Map({}, false, fnStop) : TakeAwayBesides(rgOthers, fnStop);
         if (result.transport.IsOk() && result.rgOutcomes.empty()) {
             mTold.Get().blWithdrawn = true;
             mTold.Save();

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <functional>
+#include <map>
 #include <string>
 #include <utility>
 #include <vector>
@@ -48,6 +49,8 @@ protected:
     virtual std::string Outside(const std::function<bool()>& fnStop) = 0;
     // The gateway or the box's own address is another one: nothing of what was known holds.
     virtual void NewGateway() = 0;
+    // Whether something of ours may be at the gateway, by the record.
+    virtual bool HasMade(const std::function<bool()>& fnStop) = 0;
     // Several passes in a row have failed.
     virtual void LostRouter() {}
 
@@ -60,6 +63,8 @@ protected:
     // or else the same as before.
     RouterName Front(const std::function<bool()>& fnStop);
     uint32_t WishedLease() const { return mNWishedLease; }
+    // What a pass leaves alone, as the other daemon has the turn: by place, the port of the box.
+    const std::map<MappingKey, uint16_t>& Others() const { return mMapOthers; }
 
 private:
     bool MendRunKeys();
@@ -68,6 +73,7 @@ private:
     bool FindGateway();
     bool TakeTurn(const std::function<bool()>& fnStop);
     PassResult Pass(bool blRequested, const std::function<bool()>& fnStop);
+    PassResult TakeAwayBesides(const std::vector<RouterMapping>& rgOthers, const std::function<bool()>& fnStop);
     void AddRules(OutcomeList& rgOutcomes) const;
     void WriteResults(const OutcomeList& rgOutcomes) const;
     int SecondsToNext(const PassResult& result, bool blRequested);
@@ -85,6 +91,7 @@ private:
     Announcements mAnnouncements;
     std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
     RouterTurn mTurn;
+    std::map<MappingKey, uint16_t> mMapOthers;
     std::string mSzGateway;
     std::string mSzBox;
     std::string mSzHardware;  // of the gateway, as it was last seen

@@ -59,6 +59,11 @@ bool NatpmpMapper::OnWake() {
     return blRestart;
 }
 
+bool NatpmpMapper::HasMade(const std::function<bool()>& fnStop) {
+    mMade.Get().TurnTo(Front(fnStop));
+    return !LeftOnRecord(mMade.Get(), {}, {.blLeases = true}, {}, BootSeconds()).empty();
+}
+
 PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                              const std::function<bool()>& fnStop) {
     Record& record = mMade.Get();
@@ -82,7 +87,9 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
     mHabit.nLease = WishedLease();
     // The gateway cannot be asked what it has: a request has every mapping asked for again.
     Forget(record, mHabit, Box(), blRestarted, blRequested || mBlDoubtful, BootSeconds());
-    const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, Around(Box(), fnStop, mMade)); };
+    Surroundings around = Around(Box(), fnStop, mMade);
+    around.mapOthers = Others();
+    const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, around); };
     PassResult result = fnPass();
     if (mPEpoch->TakeRestart()) {  // it restarted while we spoke
         record.Lose(Box());

@@ -32,6 +32,7 @@ private:
     std::string ResultText(const OutcomeList& rgOutcomes) const override;
     std::string Outside(const std::function<bool()>& fnStop) override;
     void NewGateway() override;
+    bool HasMade(const std::function<bool()>& fnStop) override;
 
     GatewayAnnouncements mAnnounced;
     MadeFile mMade;

@@ -78,6 +78,11 @@ bool UpnpMapper::OnWake() {
     return (mEvents.TakeNews() && BootClock::now() >= mQuietUntil) || blRouter;
 }
 
+bool UpnpMapper::HasMade(const std::function<bool()>& fnStop) {
+    mMade.Get().TurnTo(Front(fnStop));
+    return !LeftOnRecord(mMade.Get(), {}, {}, {}, BootSeconds()).empty();
+}
+
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     if (!FindRouter(fnStop)) {
         mMade.Get().TurnTo(Front([] { return true; }));  // nobody is there to be asked
@@ -85,7 +90,10 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         result.blStopped = fnStop();
         // A router that maps no ports any more may still forward those that we made.
         for (Outcome& left : LeftOnRecord(mMade.Get(), rgWanted, {}, result.transport, BootSeconds())) {
-            result.rgOutcomes.push_back(std::move(left));
+            const auto it = Others().find({left.szProtocol, left.nRouterPort});
+            if (it == Others().end() || it->second != left.nBoxPort) {
+                result.rgOutcomes.push_back(std::move(left));
+            }
         }
         return result;
     }
@@ -98,6 +106,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     IgdRouter router(*mPIgd);
     bool blChanged = false;
     Surroundings around = Around(Box(), fnStop, mMade);
+    around.mapOthers = Others();
     around.fnTell = [&blChanged, fnLog = around.fnTell](const RouterMapping& mapping, const Step& step) {
         blChanged = true;
         fnLog(mapping, step);

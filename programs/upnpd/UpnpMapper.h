@@ -29,6 +29,7 @@ private:
     std::string ResultText(const OutcomeList& rgOutcomes) const override;
     std::string Outside(const std::function<bool()>& fnStop) override;
     void NewGateway() override;
+    bool HasMade(const std::function<bool()>& fnStop) override;
     void LostRouter() override;
 
     bool FindRouter(const std::function<bool()>& fnStop);

@@ -170,6 +170,42 @@ class FaultyGateway(unittest.TestCase):
                 why = json.loads(LAB.read("/run/tavo/natpmpd.json"))["rules"][0].get("why", "")
                 self.assertEqual("1 seconds at a time" in str(why), lease == 1, why)
 
+    def test_what_upnpd_could_not_take_away_when_it_was_switched_off_goes_later_and_nothing_else(self):
+        cut = ("'add table inet cut; add chain inet cut in { type filter hook input priority -10; }; "
+               f"add rule inet cut in iifname br0 ip saddr {BOX} drop'")
+        new = ("2,1,tcp,5002,5002", "3,1,tcp,5003,5003")
+        upnp = lambda: {row[1] for row in LAB.scripted()["table"]}
+        left = lambda: [row["name"] for row in json.loads(LAB.read("/run/tavo/upnpd.json"))["left_over"]]
+
+        def away():
+            LAB.run("router", "nft " + cut)
+            LAB.save(*new, seconds=120)
+            wait_for(lambda: left() == ["5001/tcp"], 40, "it is named")
+            LAB.run("router", "nft delete table inet cut")
+
+        def crash():
+            LAB.run("box", f"curl -s http://{homelab.GATEWAY}:5000/hang?6")
+            saving = LAB.start_save(*new)
+            time.sleep(1.5)
+            os.kill(LAB.daemon_pid("upnpd"), signal.SIGKILL)
+            saving.communicate(timeout=120)
+
+        for switch in (away, crash):
+            with self.subTest(switch=switch), self.gateway("none", 5), contextlib.ExitStack() as after:
+                LAB.router_conf(natpmp=False)
+                LAB.start_scripted("only_permanent")
+                after.callback(LAB.end, LAB.router)
+                after.callback(LAB.run, "router", "nft delete table inet cut", check=False)
+                LAB.save("1,1,tcp,5001,5001", "2,1,tcp,5002,5002")
+                self.assertEqual(upnp(), {5001, 5002})
+                LAB.router_conf(natpmp=True)
+                switch()
+                wait_for(lambda: 5001 not in upnp() and left() == [], 40, "what no rule asks for is gone")
+                wait_for(lambda: set(self.state()["table"]) == {"tcp 5002", "tcp 5003"}, 40, "and what they ask for is there")
+                self.assertTrue(switch != away or upnp() == {5002}, "which may be the same mapping")
+                LAB.save("3,1,tcp,5003,5003")
+                wait_for(lambda: upnp() == set(), 20, "the last of it has gone with its rule")
+
     def test_a_silent_gateway_does_not_hold_a_stop_and_what_is_held_stays_known(self):
         with self.gateway("none") as gateway:
             LAB.save("1,1,tcp,5001,5001")

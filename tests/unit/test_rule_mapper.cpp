@@ -49,6 +49,9 @@ public:
     PassResult Map(const std::vector<RouterMapping>& rgWanted, bool blRequested,
                    const std::function<bool()>&) override {
         mRgszCalls.push_back((blRequested ? "request " : "map ") + std::to_string(rgWanted.size()));
+        for (const auto& [key, nBoxPort] : Others()) {
+            mRgszCalls.back() += " beside " + key.first + std::to_string(key.second) + " " + std::to_string(nBoxPort);
+        }
         mBlMarkedAtMap = std::filesystem::exists(kNames.szResultFile);
         PassResult result = mResult;
         for (const RouterMapping& wanted : rgWanted) {
@@ -68,6 +71,7 @@ public:
         return mSzOutside;
     }
     void NewGateway() override { mRgszCalls.push_back("new " + Gateway() + " " + Box()); }
+    bool HasMade(const std::function<bool()>&) override { return mBlMade; }
     void LostRouter() override { mRgszCalls.emplace_back("lost"); }
 
     using RuleMapper::WishedLease;
@@ -79,6 +83,7 @@ public:
     PassResult mResult;
     std::string mSzOutside = "198.51.100.1";
     std::string mSzWord = "1";  // of each port
+    bool mBlMade = false;       // something is on record
     bool mBlMarkedAtMap = true;
     bool mBlStop = false;
     int mNAsked = 0;  // how often, whether to stop
@@ -176,9 +181,23 @@ TEST_F(RuleMapping, ThereIsOneDaemonAtTheRouter) {
         Switch(false);
         EXPECT_EQ(mapper.Pass(true), 10);
         EXPECT_LE(mapper.mNAsked, 1) << "one that is switched off waits for nobody";
-        gNClockStep = 0;
         EXPECT_TRUE(mapper.Withdraw([] { return false; }));
-        EXPECT_EQ(mapper.TakeCalls(), Lines());
+        mapper.TakeCalls();
+        mapper.mBlMade = true;
+        mapper.mResult.transport = {tavo::Reply::kTimeout};
+        EXPECT_EQ(mapper.Pass(), 10);
+        EXPECT_EQ(mapper.TakeCalls(), (Lines{"map 0 beside TCP80 8080"}))
+            << "its own goes, as soon as the router is back";
+        mapper.mResult.transport = {};
+        EXPECT_TRUE(mapper.Withdraw([] { return false; }));
+        EXPECT_EQ(mapper.TakeCalls(), (Lines{"map 0 beside TCP80 8080"}));
+        Write(kRules, "this is no rule file\n");
+        mapper.Pass(true);
+        EXPECT_FALSE(mapper.Withdraw([] { return false; }));
+        EXPECT_EQ(mapper.TakeCalls(), Lines()) << "nobody knows what is the other's";
+        Write(kRules, kRule);
+        mapper.mBlMade = false;
+        gNClockStep = 0;
     }
     Switch(true);
     mapper.Pass(true);
