@@ -122,9 +122,10 @@ std::vector<RuleFact> RulesOf(const Situation& situation, const Published& publi
     for (const PublishedRule& told : published.rgRules) {
         const auto pSame = std::find_if(rgFacts.begin(), rgFacts.end(),
                                         [&](const RuleFact& fact) { return fact.rule.szName == told.szRule; });
-        RuleFact& fact = pSame == rgFacts.end() ? rgFacts.emplace_back() : *pSame;
-        fact.rule.szName = told.szRule;
-        if (pSame == rgFacts.end()) {
+        const bool blNew = pSame == rgFacts.end();  // asked here: a new one leaves the iterator invalid
+        RuleFact& fact = blNew ? rgFacts.emplace_back() : *pSame;
+        if (blNew) {
+            fact.rule.szName = told.szRule;
             fact.enFate = Fate::kOpen;
         }
         PortFact port = FactOf({told.szProtocol, told.nRouterPort, told.nBoxPort}, told);

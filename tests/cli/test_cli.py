@@ -1000,8 +1000,9 @@ class Tool(unittest.TestCase):
 
     def test_status_says_what_the_service_manager_has_of_the_daemon(self):
         """The unit's state by systemctl, whether the daemon lives, and the words that tell of it."""
-        put("/usr/bin/systemctl", "#!/bin/sh\ncat /tmp/unit\n")
-        os.chmod("/usr/bin/systemctl", 0o755)
+        put("/usr/bin/systemctl.new", "#!/bin/sh\ncat /tmp/unit\n")
+        os.chmod("/usr/bin/systemctl.new", 0o755)
+        os.rename("/usr/bin/systemctl.new", "/usr/bin/systemctl")  # a real one is nobody's in a user's sandbox: only its place is ours
         os.makedirs("/run/systemd/system")
         self.addCleanup(shutil.rmtree, "/run/systemd")
         for state, alive, code, pattern in (
@@ -1088,6 +1089,10 @@ class Tool(unittest.TestCase):
             self.assertEqual(run.returncode, REFUSED if seen else FAILED, run.stderr)
             self.assertEqual(("web   443/tcp to 8443" in run.stdout, "refused  taken" in run.stdout), (seen, seen), run.stdout)
             os.unlink("/run/tavo/upnpd.json") if seen else None
+        self.publish(pid)
+        run = subprocess.run([*user, TOOL, "status"], text=True, capture_output=True, check=False)
+        self.assertEqual(run.returncode, OK, run.stdout + run.stderr)
+        self.assertIn("all 2 rules are in force", run.stdout)
 
     def test_status_asks_the_router_itself_when_it_is_told_to(self):
         self.publish(self.keep())
