@@ -3,6 +3,8 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <map>
+#include <set>
 
 #include "Box.h"
 #include "Commands.h"
@@ -42,22 +44,73 @@ Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnC
 
 // ---- close -------------------------------------------------------------------------------------------------
 
-// The ports that a word means: a number is a port, whatever rules are called; else those of the rules with this name,
-// else those that the word stands for. Nothing when it means none.
-std::optional<std::vector<PortPair>> Meant(const Rules& rules, const std::string& szWord) {
+// What a word means.
+struct Meaning {
+    std::set<std::string> setPorts;     // "443/tcp"
+    std::optional<std::string> szRule;  // only of rules with this name; nothing: whatever they are called
+    bool blNameless = false;            // and of rules without a name
+
+    bool IsOf(const Rule& rule) const {
+        return !szRule || rule.szName == *szRule || (blNameless && rule.szName.empty());
+    }
+    bool Has(const PortPair& pair) const { return setPorts.count(pair.Name()) > 0; }
+};
+
+std::set<std::string> NamesOf(const std::vector<PortPair>& rgPairs) {
+    std::set<std::string> setNames;
+    for (const PortPair& pair : rgPairs) {
+        setNames.insert(pair.Name());
+    }
+    return setNames;
+}
+
+// A number is a port, whatever rules are called; else a word is the name of a rule, and else the name of ports. Such a
+// name is no order to close what somebody has called otherwise. Nothing when it means none.
+std::optional<Meaning> Meant(const Rules& rules, const std::string& szWord) {
     const auto wish = ReadPortWish(szWord);
     Rules named;
     std::copy_if(rules.begin(), rules.end(), std::back_inserter(named),
                  [&](const Rule& rule) { return !szWord.empty() && rule.szName == szWord; });
-    if (!named.empty() && !(wish && wish->szName.empty())) {
-        return PairsOf(named);
+    const bool blNumber = wish && wish->szName.empty();
+    if (!named.empty() && !blNumber) {
+        return Meaning{NamesOf(PairsOf(named)), szWord};
     }
     if (!wish) {
         return std::nullopt;
     }
     // Without a word for the protocol both are meant: what is closed is not opened by mistake.
     const std::string szProtocol = szWord.find('/') == std::string::npos ? "all" : wish->szProtocol;
-    return PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""});
+    const auto rgPairs = PairsOf(Rule{"", true, szProtocol, wish->szPorts, wish->szPorts, "", ""});
+    return Meaning{NamesOf(rgPairs.value_or(std::vector<PortPair>())),
+                   blNumber ? std::nullopt : std::optional(wish->szName), !blNumber};
+}
+
+// "443/tcp, 5000-5002/udp"
+std::string Text(const std::vector<PortPair>& rgPairs, const char* szBetween = ", ") {
+    std::map<std::string, std::set<int>> mapPorts;
+    for (const PortPair& pair : rgPairs) {
+        mapPorts[pair.szProtocol].insert(pair.nRouter);
+    }
+    std::vector<std::string> rgszTexts;
+    for (const auto& [szProtocol, setPorts] : mapPorts) {
+        rgszTexts.push_back(PortsText({setPorts.begin(), setPorts.end()}) + "/" + szProtocol);
+    }
+    return fmt::format("{}", fmt::join(rgszTexts, szBetween));
+}
+
+// The ports that a word means and that rules with other names have: how they are closed; empty when there are none.
+std::string OthersOf(const Rules& rules, const Meaning& meaning) {
+    std::vector<std::string> rgszOthers;
+    for (const Rule& rule : rules) {
+        const auto rgPairs = rule.blEnabled && !meaning.IsOf(rule) ? PairsOf(rule) : std::nullopt;
+        std::vector<PortPair> rgMeant = rgPairs.value_or(std::vector<PortPair>());
+        std::erase_if(rgMeant, [&](const PortPair& pair) { return !meaning.Has(pair); });
+        if (!rgMeant.empty()) {
+            rgszOthers.push_back(fmt::format("Rule {} forwards {}; 'tavoportmap close {}' closes that", NameOf(rule),
+                                             Text(rgMeant), Text(rgMeant, " ")));
+        }
+    }
+    return fmt::format("{}", fmt::join(rgszOthers, "\n"));
 }
 
 // Whether the daemon has taken away all that is not asked for, although not all that is asked for is open.
@@ -66,32 +119,63 @@ bool IsNothingLeft(const Json::Value& jsAnswer) {
     return !jsAnswer.isMember("left_over") && !jsPorts.empty() && jsPorts[0].isObject();  // else the library's list
 }
 
-Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
-    std::string szWhat = Join(rgszWords);
-    size_t nClosed = 0;
-    const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
-        std::vector<PortPair> rgAll;
-        for (const std::string& szWord : rgszWords) {
-            const auto rgPairs = Meant(rules, szWord);
-            if (!rgPairs) {
-                return Reply{.enExit = kUsage,
-                             .szMessage = fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap "
-                                                      "rules list' shows them",
-                                                      Clean(szWord))};
-            }
-            rgAll.insert(rgAll.end(), rgPairs->begin(), rgPairs->end());
+// What the words mean all together; a complaint where one of them closes nothing although its ports are open.
+std::optional<Reply> Understand(const Rules& rules, const std::vector<std::string>& rgszWords,
+                                std::vector<Meaning>& rgMeanings, std::vector<std::string>& rgszOthers) {
+    for (const std::string& szWord : rgszWords) {
+        const auto meaning = Meant(rules, szWord);
+        if (!meaning) {
+            return Reply{.enExit = kUsage,
+                         .szMessage = fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap rules "
+                                                  "list' shows them",
+                                                  Clean(szWord))};
         }
-        nClosed = Close(rules, rgAll);
-        return nClosed > 0 ? std::nullopt
-                           : std::optional(Reply{.szMessage = fmt::format(
-                                                     "nothing to close: no rule in force forwards {}", Clean(szWhat))});
+        const std::string szOthers = OthersOf(rules, *meaning);
+        Rules left = rules;
+        const bool blAny =
+            !Close(left, [&](const Rule& rule, const PortPair& pair) { return meaning->IsOf(rule) && meaning->Has(pair); })
+                 .empty();
+        if (!blAny && !szOthers.empty()) {
+            return Reply{.enExit = kUsage,
+                         .szMessage = fmt::format("nothing was closed: no rule is called '{}'. {}", Clean(szWord),
+                                                  szOthers)};
+        }
+        if (!szOthers.empty()) {
+            rgszOthers.push_back(szOthers);
+        }
+        rgMeanings.push_back(*meaning);
+    }
+    return std::nullopt;
+}
+
+Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
+    std::vector<PortPair> rgClosed;
+    std::vector<std::string> rgszOthers;
+    const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
+        std::vector<Meaning> rgMeanings;
+        if (const auto reply = Understand(rules, rgszWords, rgMeanings, rgszOthers)) {
+            return reply;
+        }
+        rgClosed = Close(rules, [&](const Rule& rule, const PortPair& pair) {
+            return std::any_of(rgMeanings.begin(), rgMeanings.end(),
+                               [&](const Meaning& meaning) { return meaning.IsOf(rule) && meaning.Has(pair); });
+        });
+        return !rgClosed.empty()
+                   ? std::nullopt
+                   : std::optional(Reply{.szMessage = fmt::format("nothing to close: no rule in force forwards {}",
+                                                                  Clean(Join(rgszWords)))});
     };
     return Change(blJson, fnChange, [&](Reply& reply) {
-        reply.jsAnswer["closed"] = static_cast<Json::UInt>(nClosed);
+        const std::string szClosed = Text(rgClosed);
+        reply.jsAnswer["closed"] = static_cast<Json::UInt>(rgClosed.size());
+        for (const std::string& szName : NamesOf(rgClosed)) {
+            reply.jsAnswer["closed_ports"].append(szName);
+        }
+        reply.rgszWarnings.insert(reply.rgszWarnings.end(), rgszOthers.begin(), rgszOthers.end());
         if (reply.enExit == kOk) {
-            reply.szMessage = fmt::format("{} closed; {}", Clean(szWhat), reply.szMessage);
+            reply.szMessage = fmt::format("{} closed; {}", szClosed, reply.szMessage);
         } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
-            reply.szMessage += fmt::format("\n{} itself, which was to be closed, is closed", Clean(szWhat));
+            reply.szMessage += fmt::format("\n{}, which was to be closed, is closed", szClosed);
         }
     });
 }

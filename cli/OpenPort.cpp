@@ -27,11 +27,11 @@ std::map<std::string, Owner> OwnersOf(const Rules& rules) {
     return mapOwners;
 }
 
+}  // namespace
+
 std::string NameOf(const Rule& rule) {
     return Clean(rule.szId) + (rule.szName.empty() ? "" : fmt::format(" ({})", Clean(rule.szName)));
 }
-
-}  // namespace
 
 Opening Open(const Rules& rules, const Rule& wanted) {
     const auto mapOwners = OwnersOf(rules);
@@ -66,25 +66,21 @@ Opening Open(const Rules& rules, const Rule& wanted) {
     return opening;
 }
 
-size_t Close(Rules& rules, const std::vector<PortPair>& rgWished) {
-    std::map<std::string, bool> mapWished;
-    for (const PortPair& pair : rgWished) {
-        mapWished[pair.Name()] = true;
-    }
-    size_t nClosed = 0;
+std::vector<PortPair> Close(Rules& rules, const std::function<bool(const Rule&, const PortPair&)>& fnGoes) {
+    std::vector<PortPair> rgClosed;
     Rules left;
     for (const Rule& rule : rules) {
         if (!rule.blEnabled) {
             left.push_back(rule);
             continue;
         }
-        size_t nGone = 0;
         Rules parts = Without(rule, [&](const PortPair& pair) {
-            const bool blGoes = mapWished.count(pair.Name()) > 0;
-            nGone += blGoes ? 1 : 0;
+            const bool blGoes = fnGoes(rule, pair);
+            if (blGoes) {
+                rgClosed.push_back(pair);
+            }
             return blGoes;
         });
-        nClosed += nGone;
         for (size_t i = 0; i < parts.size(); ++i) {
             Rules others = rules;
             others.insert(others.end(), left.begin(), left.end());
@@ -93,7 +89,7 @@ size_t Close(Rules& rules, const std::vector<PortPair>& rgWished) {
         }
     }
     rules = left;
-    return nClosed;
+    return rgClosed;
 }
 
 }  // namespace tavo::cli

@@ -2,6 +2,7 @@
 // what is asked for and nothing else changes; a rule that shares its ports with others keeps those.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -18,7 +19,10 @@ struct Opening {
 // rules with wanted in force; a rule that was switched off and forwards just this is switched on.
 Opening Open(const Rules& rules, const Rule& wanted);
 
-// rules without the ports of rgWished ("443/tcp") wherever they are in force; how many ports that closed.
-size_t Close(Rules& rules, const std::vector<PortPair>& rgWished);
+// rules without the ports in force for which fnGoes is true; what that closed.
+std::vector<PortPair> Close(Rules& rules, const std::function<bool(const Rule&, const PortPair&)>& fnGoes);
+
+// "8 (shop)", cleaned.
+std::string NameOf(const Rule& rule);
 
 }  // namespace tavo::cli

@@ -419,6 +419,7 @@ class Tool(unittest.TestCase):
     def test_ports_are_opened_and_closed_in_one_command(self):
         """Rules before, the command, its exit code and words, the rules in force then."""
         web, span = (1, "tcp", "443", "8443", "web"), (1, "all", "5000-5004", "5000-5004", "")
+        shop = (1, "tcp", "80", "8080", "shop")
         off = lambda rule: (0, *rule[1:])
         put("/etc/services", "domain 53/tcp\ndomain 53/udp\nzero 0/tcp\nodd 70000/tcp even\nlast 65535/tcp\nother 7070/tcp even # odd\n")
         for before, command, code, pattern, after in (
@@ -440,14 +441,22 @@ class Tool(unittest.TestCase):
                 (((1, "TCP", "443", "8443", "web"), (1, "Tcp_Udp", "53", "53", "")), "close 443 53/udp", OK, "closed; 1 rule",
                  ((1, "tcp", "53", "53", ""),)),
                 (((1, "both", "443", "443", ""),), "open 443", OK, "was open", ((1, "all", "443", "443", ""),)),
-                ((web, span), "close 443", OK, "443 closed; 1 rule in force", (span,)),
-                ((web, span), "close web", OK, "web closed", (span,)),
+                ((web, span), "close 443", OK, "443/tcp closed; 1 rule in force", (span,)),
+                ((web, span), "close web", OK, "443/tcp closed", (span,)),
+                ((shop,), "close web", USAGE, r"nothing was closed: no rule is called 'web'. Rule 7 \(shop\) forwards 80/tcp; .*close 80/tcp'", (shop,)),
+                ((shop,), "close 53 http", USAGE, "no rule is called 'http'", (shop,)),
+                ((off(web), shop), "close web", OK, "nothing to close", (off(web), shop)),
+                (((1, "tcp", "80,90", "80,90", "web"), shop), "close web", OK, "80,90/tcp closed; 1 rule", (shop,)),
+                (((1, "tcp", "443", "443", ""), shop), "close web", OK,
+                 r"(?s)443/tcp closed; 1 rule in force.*warning: Rule 8 \(shop\) forwards 80/tcp", (shop,)),
+                (((1, "tcp", "22", "22", "ssh"), shop), "close ssh/tcp", OK, "22/tcp closed", (shop,)),
+                ((shop,), "close 80", OK, "80/tcp closed", ()),
                 ((span,), "close 5002/udp", OK, "closed", ((1, "tcp", "5000-5004", "5000-5004", ""),
                                                            (1, "udp", "5000-5001,5003-5004", "5000-5001,5003-5004", ""))),
                 ((span,), "close 5000-5002", OK, "closed", ((1, "all", "5003-5004", "5003-5004", ""),)),
                 ((off(web),), "close 443", OK, "nothing to close", (off(web),)),
                 ((span,), "close 443", OK, "nothing to close", (span,)),
-                (((1, "tcp", "80", "80", "443"), web), "close 443", OK, "443 closed", ((1, "tcp", "80", "80", "443"),)),
+                (((1, "tcp", "80", "80", "443"), web), "close 443", OK, "443/tcp closed", ((1, "tcp", "80", "80", "443"),)),
                 ((web,), "close wbe", USAGE, "neither a port nor the name of a rule", (web,)),
                 ((off(web),), "off", OK, "nothing to switch off", (off(web),)),
                 ((web,), "on", OK, "nothing to switch on", (web,))):

@@ -52,10 +52,10 @@ class RealRouter(Case):
                 ("open 8443 --to 5001", "was open already on the router and leads to port 5001", {("tcp", 8443): 5001}),
                 ("open 6000-6001/udp --to 5001-5002", r"port 6000-6001 .udp. is open",
                  {("tcp", 8443): 5001, ("udp", 6000): 5001, ("udp", 6001): 5002}),
-                ("close 6000", "6000 closed; 2 rules in force", {("tcp", 8443): 5001, ("udp", 6001): 5002}),
+                ("close 6000", "6000/udp closed; 2 rules in force", {("tcp", 8443): 5001, ("udp", 6001): 5002}),
                 ("off", "every port is closed, and the rules are kept", {}),
                 ("on", "2 rules in force", {("tcp", 8443): 5001, ("udp", 6001): 5002}),
-                ("close web", "web closed; 1 rule in force", {("udp", 6001): 5002}),
+                ("close web", "8443/tcp closed; 1 rule in force", {("udp", 6001): 5002}),
                 ("close 6001", "keeps none of ours", {})):
             self.tool(command, OK, pattern)
             self.assertEqual(self.open_ports(), wanted, f"when '{command}' has ended")
