@@ -17,6 +17,10 @@ namespace tavo::cli {
 
 namespace {
 
+constexpr char kUnnoted[] =
+    "what to switch on again could not be noted in /etc/portforward; is the disk full or read-only? Nothing was "
+    "changed";
+
 // Has fnChange change the rules in force and saves them. fnChange answers what there is to say when nothing is to be
 // saved; fnDone completes the reply to a save whose rules are in rule.conf.
 Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnChange,
@@ -43,6 +47,23 @@ Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnC
 }
 
 // ---- close -------------------------------------------------------------------------------------------------
+
+// Switches on what was on before.
+void SwitchOn(Rules& rules, const Rules& before) {
+    for (Rule rule : before) {
+        rule.blEnabled = false;
+        const auto pRule = std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
+            return !there.blEnabled && there.szId == rule.szId && IsSameContent(there, rule);
+        });
+        const auto pSame =
+            pRule != rules.end() ? pRule : std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
+                return IsSameContent(there, rule);
+            });
+        if (pSame != rules.end()) {
+            pSame->blEnabled = true;
+        }
+    }
+}
 
 // What a word means.
 struct Meaning {
@@ -132,13 +153,13 @@ std::optional<Reply> Understand(const Rules& rules, const std::vector<std::strin
         }
         const std::string szOthers = OthersOf(rules, *meaning);
         Rules left = rules;
-        const bool blAny =
-            !Close(left, [&](const Rule& rule, const PortPair& pair) { return meaning->IsOf(rule) && meaning->Has(pair); })
-                 .empty();
+        const bool blAny = !Close(left, [&](const Rule& rule, const PortPair& pair) {
+                                return meaning->IsOf(rule) && meaning->Has(pair);
+                            }).empty();
         if (!blAny && !szOthers.empty()) {
-            return Reply{.enExit = kUsage,
-                         .szMessage = fmt::format("nothing was closed: no rule is called '{}'. {}", Clean(szWord),
-                                                  szOthers)};
+            return Reply{
+                .enExit = kUsage,
+                .szMessage = fmt::format("nothing was closed: no rule is called '{}'. {}", Clean(szWord), szOthers)};
         }
         if (!szOthers.empty()) {
             rgszOthers.push_back(szOthers);
@@ -148,10 +169,71 @@ std::optional<Reply> Understand(const Rules& rules, const std::vector<std::strin
     return std::nullopt;
 }
 
+// What 'on' opens again, while ports are closed for good.
+class Waiting {
+public:
+    // Has rules as they will be once 'on' has been said.
+    void Take(Rules& rules) {
+        mBefore = LoadOff();
+        if (mBefore) {
+            SwitchOn(rules, *mBefore);
+        }
+    }
+    // The other way round. False when what is left could not be noted. Until the rules are stored the note is good
+    // for those that are there as well.
+    bool PutBack(Rules& rules) {
+        if (!mBefore) {
+            return true;
+        }
+        std::copy_if(rules.begin(), rules.end(), std::back_inserter(mAfter),
+                     [](const Rule& rule) { return rule.blEnabled; });
+        for (Rule& rule : rules) {
+            rule.blEnabled = false;
+        }
+        Rules both = *mBefore;
+        both.insert(both.end(), mAfter.begin(), mAfter.end());
+        mBlNoted = StoreOff(both);
+        return mBlNoted;
+    }
+    void End(bool blStored) {
+        if (!mBlNoted) {
+            return;
+        }
+        if (blStored && mAfter.empty()) {
+            DropOff();
+        } else {
+            StoreOff(blStored ? mAfter : *mBefore);
+        }
+    }
+    bool IsAny() const { return mBefore.has_value(); }
+    size_t Left() const { return mAfter.size(); }
+
+private:
+    std::optional<Rules> mBefore;
+    Rules mAfter;
+    bool mBlNoted = false;
+};
+
+// What to say once they are closed.
+void Describe(const std::vector<PortPair>& rgClosed, const Waiting& waiting, Reply& reply) {
+    const std::string szClosed = Text(rgClosed);
+    if (reply.enExit == kOk && waiting.IsAny()) {
+        reply.szMessage = fmt::format(
+            "every port was switched off already; {} will not be opened again by 'tavoportmap on', {}", szClosed,
+            waiting.Left() > 0 ? "which brings back the others" : "and no other one waits for it");
+    } else if (reply.enExit == kOk) {
+        reply.szMessage = fmt::format("{} closed; {}", szClosed, reply.szMessage);
+    } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
+        reply.szMessage += fmt::format("\n{}, which was to be closed, is closed", szClosed);
+    }
+}
+
 Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
     std::vector<PortPair> rgClosed;
     std::vector<std::string> rgszOthers;
+    Waiting waiting;
     const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
+        waiting.Take(rules);
         std::vector<Meaning> rgMeanings;
         if (const auto reply = Understand(rules, rgszWords, rgMeanings, rgszOthers)) {
             return reply;
@@ -160,24 +242,30 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
             return std::any_of(rgMeanings.begin(), rgMeanings.end(),
                                [&](const Meaning& meaning) { return meaning.IsOf(rule) && meaning.Has(pair); });
         });
-        return !rgClosed.empty()
-                   ? std::nullopt
-                   : std::optional(Reply{.szMessage = fmt::format("nothing to close: no rule in force forwards {}",
-                                                                  Clean(Join(rgszWords)))});
+        if (rgClosed.empty()) {
+            return Reply{.szMessage =
+                             fmt::format("nothing to close: no rule in force forwards {}", Clean(Join(rgszWords)))};
+        }
+        if (!waiting.PutBack(rules)) {
+            return Failure(kUnnoted);
+        }
+        return std::nullopt;
     };
-    return Change(blJson, fnChange, [&](Reply& reply) {
-        const std::string szClosed = Text(rgClosed);
+    bool blStored = false;
+    const Reply answer = Change(blJson, fnChange, [&](Reply& reply) {
+        blStored = true;
+        waiting.End(true);
         reply.jsAnswer["closed"] = static_cast<Json::UInt>(rgClosed.size());
         for (const std::string& szName : NamesOf(rgClosed)) {
             reply.jsAnswer["closed_ports"].append(szName);
         }
         reply.rgszWarnings.insert(reply.rgszWarnings.end(), rgszOthers.begin(), rgszOthers.end());
-        if (reply.enExit == kOk) {
-            reply.szMessage = fmt::format("{} closed; {}", szClosed, reply.szMessage);
-        } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
-            reply.szMessage += fmt::format("\n{}, which was to be closed, is closed", szClosed);
-        }
+        Describe(rgClosed, waiting, reply);
     });
+    if (!blStored) {
+        waiting.End(false);
+    }
+    return answer;
 }
 
 // ---- off, on -----------------------------------------------------------------------------------------------
@@ -193,9 +281,7 @@ Reply Off(bool blJson) {
                                               : "nothing to switch off: no rule in force opens a port"};
         }
         if (!StoreOff(on)) {
-            return Failure(
-                "what to switch on again could not be noted in /etc/portforward; is the disk full or "
-                "read-only? Nothing was changed");
+            return Failure(kUnnoted);
         }
         blNoted = true;
         for (Rule& rule : rules) {
@@ -215,23 +301,6 @@ Reply Off(bool blJson) {
     }
     reply.jsAnswer["off"] = IsOff();
     return reply;
-}
-
-// Switches on what was on before.
-void SwitchOn(Rules& rules, const Rules& before) {
-    for (Rule rule : before) {
-        rule.blEnabled = false;
-        const auto pRule = std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
-            return !there.blEnabled && there.szId == rule.szId && IsSameContent(there, rule);
-        });
-        const auto pSame =
-            pRule != rules.end() ? pRule : std::find_if(rules.begin(), rules.end(), [&](const Rule& there) {
-                return IsSameContent(there, rule);
-            });
-        if (pSame != rules.end()) {
-            pSame->blEnabled = true;
-        }
-    }
 }
 
 Reply On(bool blJson) {
