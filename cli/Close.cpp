@@ -21,6 +21,8 @@ constexpr char kUnnoted[] =
     "what to switch on again could not be noted in /etc/portforward; is the disk full or read-only? Nothing was "
     "changed";
 
+constexpr char kOffAlready[] = "every port is switched off already; 'tavoportmap on' opens them again";
+
 // Has fnChange change the rules in force and saves them. fnChange answers what there is to say when nothing is to be
 // saved; fnDone completes the reply to a save whose rules are in rule.conf.
 Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnChange,
@@ -134,6 +136,11 @@ std::string OthersOf(const Rules& rules, const Meaning& meaning) {
     return fmt::format("{}", fmt::join(rgszOthers, "\n"));
 }
 
+// Whether the rules are stored, and only the router could not be told, by the word of who tells it.
+bool IsRouterAway(const Reply& reply) {
+    return reply.enExit == kAway && reply.jsAnswer.isMember("ports");
+}
+
 // Whether the daemon has taken away all that is not asked for, although not all that is asked for is open.
 bool IsNothingLeft(const Json::Value& jsAnswer) {
     const Json::Value& jsPorts = jsAnswer["ports"];
@@ -223,6 +230,8 @@ void Describe(const std::vector<PortPair>& rgClosed, const Waiting& waiting, Rep
             waiting.Left() > 0 ? "which brings back the others" : "and no other one waits for it");
     } else if (reply.enExit == kOk) {
         reply.szMessage = fmt::format("{} closed; {}", szClosed, reply.szMessage);
+    } else if (IsRouterAway(reply)) {
+        reply.szMessage = fmt::format("{} closed on this box, not yet on the router\n{}", szClosed, reply.szMessage);
     } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
         reply.szMessage += fmt::format("\n{}, which was to be closed, is closed", szClosed);
     }
@@ -270,15 +279,20 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
 
 // ---- off, on -----------------------------------------------------------------------------------------------
 
+// Said once more it tells the router again, which may not have heard it.
 Reply Off(bool blJson) {
     bool blNoted = false;
+    bool blAlready = false;
     const auto fnChange = [&](Rules& rules) -> std::optional<Reply> {
         Rules on;
         std::copy_if(rules.begin(), rules.end(), std::back_inserter(on),
                      [](const Rule& rule) { return rule.blEnabled; });
+        blAlready = on.empty() && IsOff();
+        if (blAlready && Gateway()) {
+            return std::nullopt;
+        }
         if (on.empty()) {
-            return Reply{.szMessage = IsOff() ? "every port is switched off already; 'tavoportmap on' opens them again"
-                                              : "nothing to switch off: no rule in force opens a port"};
+            return Reply{.szMessage = blAlready ? kOffAlready : "nothing to switch off: no rule in force opens a port"};
         }
         if (!StoreOff(on)) {
             return Failure(kUnnoted);
@@ -293,7 +307,13 @@ Reply Off(bool blJson) {
     Reply reply = Change(blJson, fnChange, [&](Reply& done) {
         blStored = true;
         if (done.enExit == kOk) {
-            done.szMessage = "every port is closed, and the rules are kept; 'tavoportmap on' opens them again";
+            done.szMessage = blAlready ? kOffAlready
+                                       : "every port is closed, and the rules are kept; 'tavoportmap on' opens them "
+                                         "again";
+        } else if (IsRouterAway(done)) {
+            done.szMessage =
+                "every port is switched off on this box, not yet on the router; 'tavoportmap on' opens them again\n" +
+                done.szMessage;
         }
     });
     if (blNoted && !blStored) {

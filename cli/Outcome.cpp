@@ -43,10 +43,15 @@ std::optional<std::string> WhyAway(const Published& published, const std::string
     }
     const std::string szWhat = fmt::format(fmt::runtime(pCause->szWhat), szGateway);
     const std::string szDo = fmt::format(fmt::runtime(pCause->szDo), szGateway);
+    // Of those that are written once nobody tries again.
+    const std::string szLater =
+        published.szProtocol == "pages"
+            ? fmt::format("'tavoportmap {}' tells it again when it is back", IsOff() ? "off" : "save")
+            : "the daemon brings the router in line with them as soon as it is back";
     return fmt::format(
-        "{}: nothing was refused, and nothing is known to be open. The rules are stored, and the daemon goes on trying "
-        "until it is back\n{}; 'tavoportmap status' shows how it is",
-        szWhat, szDo);
+        "{}: nothing was refused, and what is open there is not known. The rules are stored; {}\n{}; 'tavoportmap "
+        "status' shows how it is",
+        szWhat, szLater, szDo);
 }
 
 std::string StateWords(const PublishedRule& rule) {
@@ -168,8 +173,9 @@ Reply OutcomeOf(const Published& published, const Rules& rules, const std::strin
     reply.szMessage =
         nNot > 0    ? fmt::format("{} not open on the router; {}. {}", Count(nNot, "port"), szOthers, Remedy(published))
         : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; {}", Count(nLeft, "port"),
-                                  published.szProtocol == "pages" ? "the next 'tavoportmap save' tries again"
-                                                                  : "the daemon goes on trying")
+                                  published.szProtocol != "pages" ? "the daemon goes on trying"
+                                  : IsOff()                       ? "'tavoportmap off' tries again"
+                                                                  : "the next 'tavoportmap save' tries again")
         : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
                     : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
     return reply;

@@ -291,6 +291,7 @@ Reply SaveRules(const Rules& rules, bool blJson) {
     if (!szGateway) {
         Reply reply = NoGateway();
         reply.enExit = kAway;
+        reply.szMessage += "\nNothing was changed";
         return reply;
     }
     if (const auto reply = Unwritable(rules)) {

@@ -504,7 +504,7 @@ class Tool(unittest.TestCase):
                 ((refused,), {}, REFUSED, r"443/tcp +refused +taken \(192.168.77.7, console\)(?s:.)*Choose other router ports"),
                 (((53, "udp", {"state": "waiting", "why": "busy"}),), {}, REFUSED, "53/udp +not yet +busy"),
                 ((), {"left_over": [left]}, REFUSED, "8080/tcp +still on the router +its former address"),
-                ((refused,), {"router": "unreachable"}, AWAY, "nothing was refused, and nothing is known to be open"),
+                ((refused,), {"router": "unreachable"}, AWAY, "nothing was refused, and what is open there is not known(?s:.)*the daemon brings"),
                 ((), {"router": "no_upnp"}, AWAY, "does not offer UPnP(?s:.)*switch UPnP on"),
                 ((), {"router": "silent"}, AWAY, "192.168.77.1 does not answer(?s:.)*restart the router")):
             pid = self.keep()
@@ -516,6 +516,27 @@ class Tool(unittest.TestCase):
                              ({f"{port}/{protocol}" for port, protocol, _ in rows}, len(members.get("left_over", []))))
         self.publish(pid, refused, at=int(time.time()) + 60)
         self.expect("open 53/udp --yes", REFUSED, "(?s)443/tcp.*Port 53 itself, which was asked for, is open", **WRITES)
+
+    def test_without_the_router_close_and_off_hold_on_this_box(self):
+        """And whoever tells the router later is named: a daemon, or for a router's pages the user."""
+        pid = self.keep()
+        for upnp, program, later in (("yes", "upnpd", "the daemon brings the router in line"),
+                                     ("no", "tavoportforward", "'tavoportmap {}' tells it again when it is back")):
+            self.setUp()
+            describe("Acme", "R1", "1")
+            put(ROUTER, KNOWN % (upnp, "no") + 'conn_type="http"\nconn_port="80"\n')
+            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+            self.store((1, "tcp", "443", "443", "web"), (1, "tcp", "80", "80", ""))
+            for command, left, pattern, again in (("close web", (80,), "443/tcp closed on this box, not yet on the router", "save"),
+                                                  ("off", (), "every port is switched off on this box, not yet on the router", "off"),
+                                                  ("off", (), "every port is switched off on this box, not yet on the router", "off"),
+                                                  ("close 80", (), "80/tcp closed on this box, not yet on the router", "save")):
+                rows = [{"name": f"{port}/tcp", "router_port": port, "box_port": port, "protocol": "tcp", "rule": "x", "state": "unknown",
+                         "word": "", "why": None, "holder": None, "since": None, "until": None} for port in left]
+                self.publish(pid, name=program, protocol="pages" if upnp == "no" else "UPnP", router="unreachable",
+                             rules=rows, at=int(time.time()) + 60)
+                self.expect(command, AWAY, f"{pattern}(?s:.)*cannot be reached(?s:.)*{later.format(again)}", **WRITES)
+            self.assertEqual(self.in_force(), [])
 
     def test_setup_offers_what_listens_here_and_opens_what_is_chosen(self):
         world = {**WRITES, "TAVO_DETECT": "0 0 0 1 1 0 32 10 20 30 40 70 50 80", "TAVO_WORD": "1 -1"}
@@ -1064,7 +1085,9 @@ class Tool(unittest.TestCase):
         before = get(RULES)
         subprocess.run(["ip", "route", "del", "default"], check=True)
         self.addCleanup(lambda: subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True))
-        for code, commands in ((AWAY, ("close 443", "off", "save", "status")),
+        for command in ("close 443", "off", "save"):
+            self.expect(command, AWAY, "no default gateway(?s:.)*\nNothing was changed", **WRITES)
+        for code, commands in ((AWAY, ("status",)),
                                (FAILED, ("setup", "detect", "open 80", "save --dry-run", "router set --upnp yes", "router show",
                                          "router table", "compat --yes", "report", "service set hoplink 80/tcp", "service detect"))):
             for command in commands:
