@@ -102,7 +102,18 @@ const char* Remedy(const Published& published) {
     if (published.szProtocol == "pages" && !published.szRouterWhy.empty()) {
         return "'sudo journalctl -t tavoportforward' says more; 'tavoportmap save' tries again";
     }
-    return "Choose other router ports ('tavoportmap rules edit'), or free them there";
+    // A router that maps each port of the box but once; another router port would not help.
+    const auto nShared = static_cast<size_t>(
+        std::count_if(published.rgRules.begin(), published.rgRules.end(), [](const PublishedRule& rule) {
+            return rule.enState != PortState::kOpen && rule.szWhy.starts_with("another rule has this port of the box");
+        }));
+    if (nShared == 0) {
+        return "Choose other router ports ('tavoportmap rules edit'), or free them there";
+    }
+    return nShared == NotOpen(published)
+               ? "Choose another port of this box ('tavoportmap rules edit RULE --box-port PORT')"
+               : "Choose other router ports ('tavoportmap rules edit') or free them there, and another port of this "
+                 "box where another rule has it";
 }
 
 }  // namespace

@@ -499,9 +499,12 @@ class Tool(unittest.TestCase):
     def test_the_outcome_of_a_save_is_what_the_daemon_says(self):
         refused = (443, "tcp", {"state": "refused", "why": "taken", "holder": {"address": "192.168.77.7", "description": "console"}})
         left = {"name": "8080/tcp", "address": "192.168.77.9", "why": "its former address", "until": None}
+        shared = (5001, "tcp", {"state": "refused", "why": "another rule has this port of the box; the router gives it one router port only"})
         for rows, members, code, pattern in (
                 ((), {}, OK, "2 rules in force"),
                 ((refused,), {}, REFUSED, r"443/tcp +refused +taken \(192.168.77.7, console\)(?s:.)*Choose other router ports"),
+                ((shared,), {}, REFUSED, "other rule has this port(?s:.)*the others are in force. Choose another port of this box .*--box-port"),
+                ((refused, shared), {}, REFUSED, "Choose other router ports(?s:.)*and another port of this box"),
                 (((53, "udp", {"state": "waiting", "why": "busy"}),), {}, REFUSED, "53/udp +not yet +busy"),
                 ((), {"left_over": [left]}, REFUSED, "8080/tcp +still on the router +its former address"),
                 ((refused,), {"router": "unreachable"}, AWAY, "nothing was refused, and what is open there is not known(?s:.)*the daemon brings"),
