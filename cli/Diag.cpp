@@ -8,6 +8,7 @@
 #include "Box.h"
 #include "Capture.h"
 #include "Commands.h"
+#include "RuleStore.h"
 
 namespace tavo::cli {
 
@@ -95,7 +96,10 @@ void OfferDiag(CLI::App& app, Request& request) {
     OfferText(*pDiag, request, "to-ports", "numbers", "1,2,3,7", "numbers, ten at most, as a port list",
               &FormatNumbers);
     AddCommand(*pDiag, "rules", "the stored rules with their ports taken apart")->callback([&request] {
-        request.fnCommand = [] { return Caught(&TestFuncCreateOpRulesByRuleConf); };
+        request.fnCommand = [] {
+            const auto obstacle = LoadRules() ? std::nullopt : NeedsRoot();
+            return obstacle ? *obstacle : Caught(&TestFuncCreateOpRulesByRuleConf);
+        };
     });
     AddCommand(*pDiag, "used-ports", "the ports that other hosts hold on the UPnP router")->callback([&request] {
         request.fnCommand = &UsedPorts;

@@ -368,7 +368,7 @@ Reply Set(const Wish& wish, bool blJson) {
 Reply List() {
     auto rules = LoadRules();
     if (!rules) {
-        return Failure(kUnreadable);
+        return NeedsRoot().value_or(Failure(kUnreadable));
     }
     std::erase_if(*rules, [](const Rule& rule) { return rule.szName.empty(); });
     std::stable_sort(rules->begin(), rules->end(),

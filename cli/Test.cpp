@@ -93,7 +93,7 @@ Reply TestParts(const Rules& parts, bool blJson) {
 Reply Test(const std::vector<std::string>& rgszIds, bool blJson) {
     const auto rules = LoadRules();
     if (!rules) {
-        return Failure(kUnreadable);
+        return NeedsRoot().value_or(Failure(kUnreadable));
     }
     std::string szMissing;
     const Rules chosen = Chosen(*rules, rgszIds, szMissing);

@@ -5,6 +5,7 @@
 #include <signal.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <charconv>
@@ -228,6 +229,10 @@ int main(int argc, char** argv) {
         const bool blHelp = std::strcmp(argv[1], "--help") == 0;
         std::fputs(kHelp, blHelp ? stdout : stderr);
         return blHelp ? kAllInPlace : kUsage;
+    }
+    if (geteuid() != 0) {  // it could read neither the account nor the rules, and nobody would see what it logs
+        std::fputs("tavoportforward: this needs root: run it with sudo\n", stderr);
+        return kNotTried;
     }
     umask(022);
     signal(SIGPIPE, SIG_IGN);

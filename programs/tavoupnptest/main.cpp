@@ -1,5 +1,7 @@
 // tavoupnptest: starts a test of the router by hand, and ends a running one. Relies on the calls that the
 // library uses. Promises: waits for nothing but the start, and for the end that -t asks for.
+#include <unistd.h>
+
 #include <charconv>
 #include <cstdio>
 #include <cstring>
@@ -25,6 +27,14 @@ constexpr int kUsualRules = 60;
 constexpr int kFailed = 1;
 constexpr int kUsage = 2;
 
+bool IsRoot() {
+    if (geteuid() == 0) {
+        return true;
+    }
+    std::fputs("tavoupnptest: this needs root: run it with sudo\n", stderr);
+    return false;
+}
+
 int End() {
     tavo::EndTestDaemon();
     return tavo::IsTestDaemonAlive() ? kFailed : 0;
@@ -44,7 +54,7 @@ int Start(int nRules) {
 int main(int argc, char** argv) {
     const std::string szArgument = argc > 1 ? argv[1] : "";
     if (szArgument == "-t" && argc == 2) {
-        return End();
+        return IsRoot() ? End() : kFailed;
     }
     if (szArgument == "--help") {
         std::fputs(kHelp, stdout);
@@ -57,5 +67,5 @@ int main(int argc, char** argv) {
         std::fputs(kHelp, stderr);
         return kUsage;
     }
-    return Start(nRules);
+    return IsRoot() ? Start(nRules) : kFailed;
 }

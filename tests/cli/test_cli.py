@@ -280,6 +280,17 @@ class Tool(unittest.TestCase):
         for arguments in ("setup", "detect", "router show", "router set --upnp yes", "compat", "report"):
             self.expect(arguments, FAILED, r"^error: this command needs root: run it with sudo\n$", LD_PRELOAD=STAND_IN,
                         TAVO_UID="1000")
+        self.store((1, "tcp", "443", "8443", "web"))
+        os.chmod(RULES, 0)  # a file that may not be read is not one that is broken
+        user = ("setpriv", "--bounding-set=-dac_override,-dac_read_search", "env", f"LD_PRELOAD={STAND_IN}", "TAVO_UID=1000")
+        for command, code in (("cli/tavoportmap test", FAILED), ("cli/tavoportmap service list", FAILED),
+                              ("cli/tavoportmap diag rules", FAILED), ("cli/tavoportmap rules list", FAILED),
+                              ("programs/tavoupnptest", FAILED), ("programs/tavoupnptest -t", FAILED),
+                              ("programs/tavoportforward", 3)):
+            with self.subTest(command=command):
+                run = subprocess.run([*user, *f"{BUILD}/{command}".split()], text=True, capture_output=True, check=False)
+                self.assertEqual((run.returncode, run.stdout), (code, ""))
+                self.assertRegex(run.stderr, "^[a-z]+: this (command )?needs root: run it with sudo\n$")
 
     def test_an_answer_that_cannot_be_written_is_a_failure(self):
         with open("/dev/full", "w", encoding="utf-8") as full:
