@@ -151,6 +151,11 @@ bool IsNothingLeft(const Json::Value& jsAnswer) {
 std::optional<Reply> Understand(const Rules& rules, const std::vector<std::string>& rgszWords,
                                 std::vector<Meaning>& rgMeanings, std::vector<std::string>& rgszOthers) {
     for (const std::string& szWord : rgszWords) {
+        const auto wish = ReadPortWish(szWord);
+        const std::string szFault = wish ? FaultOfPorts(wish->szPorts) : "";
+        if (!szFault.empty()) {
+            return Reply{.enExit = kUsage, .szMessage = szFault};
+        }
         const auto meaning = Meant(rules, szWord);
         if (!meaning) {
             return Reply{.enExit = kUsage,

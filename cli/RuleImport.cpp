@@ -94,9 +94,8 @@ std::string Ids(const Rules& rules, const std::vector<size_t>& rgFound) {
 
 std::string FaultOf(const Rule& rule) {
     for (const std::string& szPorts : {rule.szRouterPorts, rule.szBoxPorts}) {
-        if (!ParsePorts(szPorts)) {
-            return fmt::format("'{}' is no port list: write ports from 1 to 65535, such as 443, 80,443 or 5000-5010",
-                               Clean(szPorts));
+        if (const std::string szFault = FaultOfPorts(szPorts); !szFault.empty()) {
+            return szFault;
         }
     }
     std::vector<int> rgRouter = *ParsePorts(rule.szRouterPorts);

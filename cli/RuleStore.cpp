@@ -152,6 +152,23 @@ std::optional<std::vector<int>> ParsePorts(const std::string& szText) {
     return rgPorts;
 }
 
+std::string FaultOfPorts(const std::string& szText) {
+    if (!ParsePorts(szText)) {
+        return fmt::format("'{}' is no port list: write ports from 1 to 65535, such as 443, 80,443 or 5000-5010",
+                           Clean(szText));
+    }
+    for (const std::string& szItem : CLI::detail::split(szText, ',')) {
+        const size_t nDash = szItem.find('-');
+        const auto nFirst = ParsePort(szItem.substr(0, nDash));
+        const auto nLast = nDash == std::string::npos ? nFirst : ParsePort(szItem.substr(nDash + 1));
+        if (*nFirst > *nLast) {
+            return fmt::format("'{}' is a range written backwards; if you mean it, write {}-{}", Clean(szItem), *nLast,
+                               *nFirst);
+        }
+    }
+    return "";
+}
+
 std::vector<Overlap> OverlapsOf(const Rules& rules) {
     std::vector<Overlap> rgFound;
     Owners tcp, udp;

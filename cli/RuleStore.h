@@ -84,6 +84,10 @@ Reply NoSuchRule(const Rules& rules, const std::string& szId);
 // The ports of a text like "80,443,5000-5010", in its order; nothing when it cannot be read.
 std::optional<std::vector<int>> ParsePorts(const std::string& szText);
 
+// Why a text that the user wrote is no port list, although it may be read as one: "5000-4000" is rather a slip of the
+// hand than an order to open a thousand ports. Empty when it is good.
+std::string FaultOfPorts(const std::string& szText);
+
 // Two enabled rules that want the same router port; the one that comes later in the file is szLater.
 struct Overlap {
     std::string szLater;

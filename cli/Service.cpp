@@ -45,6 +45,9 @@ std::string ReadRequest(const std::string& szText, __tag_TAVO_PORTMAP_RULE& requ
         return fmt::format("'{}' is no request: write ports and a protocol, such as {} or 80,443/all", Clean(szText),
                            kAsPort);
     }
+    if (const std::string szFault = FaultOfPorts(szPorts); !szFault.empty()) {
+        return szFault;
+    }
     const std::string szProtocol = szText.substr(nSlash + 1);
     const auto pWord = std::find(kProtocolWords.begin(), kProtocolWords.end(), szProtocol);
     request.enProtocol = static_cast<int>(pWord - kProtocolWords.begin());
