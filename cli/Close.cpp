@@ -238,7 +238,7 @@ void Describe(const std::vector<PortPair>& rgClosed, const Waiting& waiting, Rep
     } else if (IsRouterAway(reply)) {
         reply.szMessage = fmt::format("{} closed on this box, not yet on the router\n{}", szClosed, reply.szMessage);
     } else if (reply.enExit == kRefused && IsNothingLeft(reply.jsAnswer)) {
-        reply.szMessage += fmt::format("\n{}, which was to be closed, is closed", szClosed);
+        reply.szMessage += fmt::format("\n{} itself, which was to be closed, is closed", szClosed);
     }
 }
 

@@ -67,7 +67,7 @@ class RealRouter(Case):
         for command, pattern in (("open 9999", "(?s)9999/tcp +refused(?!.*" + itself + ").*The rule stays"),
                                  ("open 8443", "(?s)9999/tcp +refused.*Port 8443 " + itself),
                                  ("open 9998-9999/tcp", "(?s)9999/tcp +refused(?!.*" + itself + ")"),
-                                 ("close 8443", "(?s)9999/tcp +refused.*8443 itself, which was to be closed, is closed")):
+                                 ("close 8443", "(?s)9999/tcp +refused.*8443/tcp itself, which was to be closed, is closed")):
             self.tool(command, REFUSED, pattern)
         self.assertEqual(self.open_ports().keys(), {("tcp", 9998)})
 
