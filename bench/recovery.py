@@ -117,7 +117,7 @@ def deaf(cause):
 CAUSES = (("upnpd", "router restarts, announced", restart, TIMES), ("upnpd", "own address changes", own_address, TIMES),
           ("upnpd", "gateway away and back", gateway_gone, TIMES),
           ("upnpd", "restarts while the cable is out", cable, TIMES),
-          ("upnpd", "restarts, the daemon is killed", killed, TIMES),
+          ("upnpd", "restarts, the daemon is killed", killed, min(TIMES, 8)),  # its parent gives up after ten
           ("upnpd", "taken away, router tells it", in_peace(taken), TIMES),
           ("upnpd", "restarts, not heard", deaf(restart.__wrapped__), FEW),
           ("upnpd", "taken away silently", deaf(taken), FEW),
