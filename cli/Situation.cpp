@@ -112,6 +112,18 @@ const Published* Situation::Word() const {
     return blCounts && published ? &*published : nullptr;
 }
 
+std::vector<PublishedLeftOver> Situation::LeftOver() const {
+    const Published* pWord = Word();
+    auto rgLeftOver = pWord != nullptr ? pWord->rgLeftOver : std::vector<PublishedLeftOver>();
+    for (const Daemon* pDaemon : {&upnpd, &natpmpd}) {
+        if (pDaemon != Keeper() && pDaemon->blAlive && pDaemon->published) {
+            const auto& rgMore = pDaemon->published->rgLeftOver;
+            rgLeftOver.insert(rgLeftOver.end(), rgMore.begin(), rgMore.end());
+        }
+    }
+    return rgLeftOver;
+}
+
 Reach ReachOf(const std::string& szAddress) {
     in_addr address = {};
     if (inet_pton(AF_INET, szAddress.c_str(), &address) != 1) {

@@ -5,6 +5,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "LiveTable.h"
 #include "Published.h"
@@ -66,6 +67,9 @@ struct Situation {
     bool IsByPages() const { return Keeper() == nullptr && settings.blAny && settings.enWay == Way::kManual; }
     // What is known of the mappings: the keeper's word, or that of the pages.
     const Published* Word() const;
+    // What no rule asks for and the router still has: by that word, and by that of a daemon that is switched off and
+    // has not been able to take away what it made.
+    std::vector<PublishedLeftOver> LeftOver() const;
     // The router's address on its other side; empty where nobody has said it.
     std::string Outside() const { return Word() == nullptr ? "" : Word()->szOutside; }
 };

@@ -121,8 +121,7 @@ Json::Value OutsideJson(const Situation& situation) {
 
 Json::Value LeftOverJson(const Situation& situation) {
     Json::Value js = Json::arrayValue;
-    const Published* pWord = situation.Word();
-    for (const PublishedLeftOver& left : pWord != nullptr ? pWord->rgLeftOver : std::vector<PublishedLeftOver>()) {
+    for (const PublishedLeftOver& left : situation.LeftOver()) {
         Json::Value jsLeft;
         jsLeft["name"] = left.szName;
         jsLeft["address"] = TextOrNull(left.szAddress);

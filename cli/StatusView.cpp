@@ -204,9 +204,8 @@ std::string OthersText(const Judgement& judgement) {
 }
 
 std::string LeftOverText(const Situation& situation) {
-    const Published* pWord = situation.Word();
     Table table({"left over on the router", "for", "why"});
-    for (const PublishedLeftOver& left : pWord != nullptr ? pWord->rgLeftOver : std::vector<PublishedLeftOver>()) {
+    for (const PublishedLeftOver& left : situation.LeftOver()) {
         table.Add({Clean(left.szName), Clean(left.szAddress),
                    Clean(left.szWhy) + (left.nUntil ? ", until " + Moment(*left.nUntil, situation.nNow) : "")});
     }

@@ -181,6 +181,8 @@ class FaultyGateway(unittest.TestCase):
             LAB.run("router", "nft " + cut)
             LAB.save(*new, seconds=120)
             wait_for(lambda: left() == ["5001/tcp"], 40, "it is named")
+            said = json.loads(LAB.run("box", f"{homelab.BUILD}/cli/tavoportmap status --json", check=False).stdout)
+            self.assertIn("5001/tcp", [row["name"] for row in said["left_over"]])
             LAB.run("router", "nft delete table inet cut")
 
         def crash():
