@@ -293,6 +293,12 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
     RouterConfReader reader("192.168.1.1");
     RouterUpnpDB upnp(szLong, "M", "1");
     std::string szName = szLong + ": Model (" + szLong + ")";
+    const auto fnOfRule = [pConf](int (*pfnGet)(std::string&, const TAVO_PF_CONF*)) {
+        return [pfnGet, pConf] {
+            std::string szText;
+            return pfnGet(szText, pConf);
+        };
+    };
     char szPorts[8] = {};
     const struct {
         const char* szWhat;
@@ -306,30 +312,10 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
              return reader.GetBrand(szText);
          },
          1, 0},
-        {"a rule's name",
-         [&] {
-             std::string szText;
-             return PF_CONF::GetRuleID(szText, pConf);
-         },
-         1, 0},
-        {"its protocol",
-         [&] {
-             std::string szText;
-             return PF_CONF::GetRuleProtocol(szText, pConf);
-         },
-         1, 0},
-        {"its service",
-         [&] {
-             std::string szText;
-             return PF_CONF::GetRuleServiceID(szText, pConf);
-         },
-         1, 0},
-        {"its service's name",
-         [&] {
-             std::string szText;
-             return PF_CONF::GetRuleServiceName(szText, pConf);
-         },
-         1, 0},
+        {"a rule's name", fnOfRule(&PF_CONF::GetRuleID), 1, 0},
+        {"its protocol", fnOfRule(&PF_CONF::GetRuleProtocol), 1, 0},
+        {"its service", fnOfRule(&PF_CONF::GetRuleServiceID), 1, 0},
+        {"its service's name", fnOfRule(&PF_CONF::GetRuleServiceName), 1, 0},
         {"its ports",
          [&] {
              std::string szRouter, szBox;
