@@ -192,11 +192,11 @@ int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLas
                                                              {"NewProtocol", szProtocol},
                                                              {"NewManage", "0"},
                                                              {"NewNumberOfPorts", "0"}});
-    mBlRanges = answer.IsOk();
+    mBlRanges = answer.IsOk() || answer.Code() == kIgdNoneInRange;
     if (answer.IsOk()) {
         rgMappings = ReadListing(answer);
     }
-    return answer.Code();
+    return mBlRanges ? int{kWireOk} : answer.Code();
 }
 
 int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping) {

@@ -33,6 +33,7 @@ enum IgdCode : int {
     kIgdInvalidArgs = 402,
     kIgdNoSuchIndex = 713,
     kIgdNoSuchEntry = 714,
+    kIgdNoneInRange = 730,
     kIgdConflict = 718,
     kIgdOnlyPermanentLeases = 725
 };
