@@ -21,6 +21,7 @@ constexpr size_t kTogether = 512;       // wanted places that are looked at befo
 constexpr size_t kMostSaves = 8;        // of the record in one pass, however many they are
 constexpr char kWritten[] = "written";  // the router said yes, and has not shown it yet
 constexpr char kLost[] = "lost";        // the router said yes, and does not show it
+constexpr char kKept[] = "kept";        // it said yes to the removal, and shows it
 constexpr int64_t kRenewAgain = 60;     // seconds after a renewal that was refused
 constexpr int64_t kRecordAgain = 60;    // seconds after the record could not be written
 constexpr int64_t kCloseAgain = 10;     // seconds until an older place of a port of the box may be closed
@@ -39,11 +40,14 @@ private:
     void BringAll(PlaceList rgpPlaces);
     size_t Bring(PlaceList rgpPlaces);
     void TakeAway(const PlaceList& rgpPlaces);
-    bool Remove(Place& place);
+    bool Remove(Place& place, const char* szWhy);
+    void OnGone(Place& place);
+    void CheckGone();
+    void OnNotApplied();
     bool Unrecorded(Place& place);
     void Settle(Place& place);
     bool Do(Place& place, const Step& step);
-    bool Replace(Place& place);
+    bool Replace(Place& place, const char* szWhy);
     bool Renew(Place& place);
     bool Add(Place& place, bool blAnew);
     void OnMade(Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew);
@@ -56,25 +60,83 @@ private:
 
     Places& mPlaces;
     PlaceList mRgpWritten;  // to be read back
+    PlaceList mRgpGone;     // the router said yes to their removal, which is to be looked at
     RouterReply mApplied;   // whether what was done has taken effect
     int64_t mNReadBack = 0;
     // What was on record at first, where the router has one place for each port of the box: by protocol and that port.
     std::multimap<std::pair<std::string, uint16_t>, const Place*> mMapByBoxPort;
 };
 
-// True when it is gone.
-bool Carrier::Remove(Place& place) {
-    RouterReply reply = Note(mPlaces.router.Remove(mPlaces.Known(place)));
-    if (reply.IsOk() || reply.enReply == Reply::kNoSuchEntry) {
-        place.enSeen = Seen::kAbsent;
-        place.kept = {};
-        if (!mPlaces.what.blForm || place.pWanted == nullptr) {  // else it is asked for anew, and stays on record
-            Forget(place);
-        }
-        return true;
+// True when the router says that it is gone. A yes is not enough where there is more to see or to be done: the row
+// stays until then. What a rule asks for there is asked for anew, and the answer to that shows what came of it.
+bool Carrier::Remove(Place& place, const char* szWhy) {
+    place.gone = mPlaces.Known(place);
+    place.szWhyGone = szWhy;
+    RouterReply reply = Note(mPlaces.router.Remove(place.gone));
+    const Made* pMade = mPlaces.MadeAt(place);
+    if (mPlaces.what.blForm && !mPlaces.what.blShows && reply.enReply == Reply::kNoSuchEntry && pMade != nullptr &&
+        pMade->nOtherPort != 0) {  // the change of it may not have been applied
+        place.gone.nBoxPort = pMade->nOtherPort;
+        reply = Note(mPlaces.router.Remove(place.gone));
     }
-    place.kept = std::move(reply);
-    return false;
+    if (!reply.IsOk() && reply.enReply != Reply::kNoSuchEntry) {
+        place.kept = std::move(reply);
+        return false;
+    }
+    const bool blProof = reply.IsOk() && (mPlaces.what.blForm || (mPlaces.what.blShows && place.pWanted == nullptr));
+    if (blProof) {
+        mPlaces.rows.try_emplace(place.key, RowOf(place.gone, true, mPlaces.Now()));
+        mRgpGone.push_back(&place);
+    }
+    if (!blProof || place.pWanted != nullptr) {
+        OnGone(place);
+    }
+    place.enSeen = Seen::kAbsent;
+    place.kept = {};
+    return true;
+}
+
+void Carrier::OnGone(Place& place) {
+    mPlaces.around.fnTell(place.gone, {Action::kRemove, place.szWhyGone});
+    if (!mPlaces.what.blForm || place.pWanted == nullptr) {  // else it is asked for anew, and stays on record
+        Forget(place);
+    }
+}
+
+// What the router was told to take away, all of it together. Where it does not say what it has, its yes has to do; what
+// it still shows is taken away again by the next pass, unless it was only slow to go.
+void Carrier::CheckGone() {
+    PlaceList rgpGone = std::exchange(mRgpGone, {});
+    std::erase_if(rgpGone, [this](const Place* pPlace) {  // what came of those shows in what was made in their place
+        if (Made* pMade = mPlaces.MadeAt(*pPlace); pPlace->pWanted != nullptr && pMade != nullptr) {
+            pMade->nOtherPort = 0;
+        }
+        return pPlace->pWanted != nullptr;
+    });
+    if (mPlaces.what.blShows) {
+        if (IsOver()) {
+            return;
+        }
+        mPlaces.LookForGone(rgpGone);
+    }
+    for (Place* pPlace : rgpGone) {
+        if (pPlace->enSeen == Seen::kPresent && IsOurs(pPlace->entry, mPlaces.MadeAt(*pPlace), Box())) {
+            pPlace->kept = {Reply::kRefused, kKept};
+        } else if (pPlace->enSeen != Seen::kUnknown) {
+            OnGone(*pPlace);
+        } else if (!IsOver()) {
+            pPlace->kept = {Reply::kTimeout, "timeout"};
+        }
+    }
+}
+
+// What was done on a form has not taken effect: what was taken away there may be there still.
+void Carrier::OnNotApplied() {
+    for (Place* pPlace : std::exchange(mRgpGone, {})) {
+        const bool blAsWanted = pPlace->pWanted != nullptr && Serves(pPlace->gone, *pPlace->pWanted, Box());
+        pPlace->kept = blAsWanted ? RouterReply{} : mApplied;
+    }
+    mRgpWritten.clear();
 }
 
 // What the rules no longer ask for, and what has to go before something else can be made in its place.
@@ -86,10 +148,7 @@ void Carrier::TakeAway(const PlaceList& rgpPlaces) {
         const Step step = mPlaces.StepFor(*pPlace);
         const bool blAway = step.enAction == Action::kRemove || step.enAction == Action::kReplace;
         if (blAway && !mPlaces.IsOthers(*pPlace)) {
-            const RouterMapping gone = mPlaces.Known(*pPlace);
-            if (Remove(*pPlace)) {
-                mPlaces.around.fnTell(gone, step);
-            }
+            Remove(*pPlace, step.szWhy);
         } else if (step.enAction == Action::kForget) {
             Forget(*pPlace);
         }
@@ -103,6 +162,9 @@ void Carrier::Clear(PlaceList rgpPlaces) {
         mPlaces.LookAt(rgpNow);
         TakeAway(rgpNow);
         rgpPlaces.erase(rgpPlaces.begin(), rgpPlaces.begin() + static_cast<std::ptrdiff_t>(rgpNow.size()));
+    }
+    if (!mPlaces.what.blForm) {
+        CheckGone();
     }
 }
 
@@ -170,9 +232,9 @@ bool Carrier::Do(Place& place, const Step& step) {
             }
             place.szWhy = step.szWhy;
             Add(place, true);
-            return !place.blWritten && !place.blUnrecorded && !IsOver() && Replace(place);
+            return !place.blWritten && !place.blUnrecorded && !IsOver() && Replace(place, step.szWhy);
         case Action::kReplace:
-            return Replace(place);
+            return Replace(place, step.szWhy);
         case Action::kKeep:
             if (mPlaces.MadeAt(place) == nullptr) {  // made before there was a record; its age is not known
                 mPlaces.rows[place.key] = RowOf(place.entry, true, mPlaces.Now());
@@ -193,8 +255,8 @@ bool Carrier::Do(Place& place, const Step& step) {
     }
 }
 
-bool Carrier::Replace(Place& place) {
-    if (place.kept.IsOk() && Remove(place)) {
+bool Carrier::Replace(Place& place, const char* szWhy) {
+    if (place.kept.IsOk() && Remove(place, szWhy)) {
         return true;
     }
     if (place.enSeen == Seen::kHidden && Serves(mPlaces.Known(place), *place.pWanted, Box())) {
@@ -271,8 +333,10 @@ bool Carrier::Add(Place& place, bool blAnew) {
 void Carrier::OnMade(Place& place, const RouterMapping& mapping, int64_t nAsked, bool blAnew) {
     // Some say yes to a change, and leave the entry as it was.
     const bool blChange = mPlaces.what.blShows && place.enSeen == Seen::kPresent && blAnew;
+    const Made* pMade = mPlaces.MadeAt(place);
+    const uint16_t nBefore = mPlaces.what.blForm && pMade != nullptr ? pMade->nOtherPort : uint16_t{0};
     Made& made = mPlaces.rows[place.key] = RowOf(mapping, !mPlaces.what.blShows, nAsked);
-    made.nOtherPort = blChange ? place.entry.nBoxPort : uint16_t{0};
+    made.nOtherPort = blChange ? place.entry.nBoxPort : nBefore;
     if (blAnew) {
         mPlaces.around.fnTell(mapping, {Action::kAdd, place.szWhy});
     }
@@ -299,8 +363,7 @@ void Carrier::OnElsewhere(Place& place, const RouterMapping& made, const RouterR
     mPlaces.rows[other.key] = RowOf(made, true, mPlaces.Now());
     other.enSeen = Seen::kPresent;
     other.entry = made;
-    if (Remove(other)) {
-        mPlaces.around.fnTell(made, {Action::kRemove, "the router made it instead of another one"});
+    if (Remove(other, "the router made it instead of another one")) {
         mPlaces.habit.mapElsewhere[place.key] = reply.szWord;
     }
 }
@@ -338,6 +401,11 @@ void Carrier::ReadBack() {
     do {  // once more for those that had to be replaced
         if (mPlaces.what.blForm) {
             mApplied = Note(mPlaces.router.Apply());
+            if (!mApplied.IsOk()) {
+                OnNotApplied();
+                break;
+            }
+            CheckGone();
         }
         mPlaces.LookAtRanges(mRgpWritten);
         for (Place* pPlace : std::exchange(mRgpWritten, {})) {
@@ -362,7 +430,7 @@ void Carrier::Confirm(Place& place) {
     } else if (IsOver() || (!reply.IsOk() && reply.enReply != Reply::kNoSuchEntry)) {
         place.verdict = RefusedBy(reply);
     } else if (place.enSeen == Seen::kPresent && IsOurs(place.entry, mPlaces.MadeAt(place), Box()) &&
-               !std::exchange(place.blReplaced, true) && Remove(place)) {
+               !std::exchange(place.blReplaced, true) && Remove(place, "the router said yes to a change of it")) {
         place.verdict = {PortState::kRefused, kLost};
         Settle(place);
     } else if (place.enSeen == Seen::kPresent && place.entry.szClient != Box()) {

@@ -27,7 +27,11 @@ bool Intend(Places& places, const Place& place) {
                         pMade->szText != mapping.szDescription;
     const bool blNews = pMade == nullptr || pMade->szClient != mapping.szClient ||
                         pMade->nBoxPort != mapping.nBoxPort || pMade->nMore != mapping.nMore || blText;
-    places.rows[place.key] = RowOf(mapping, false, places.Now());
+    Made made = RowOf(mapping, false, places.Now());
+    if (places.what.blForm && place.gone.nBoxPort != made.nBoxPort) {
+        made.nOtherPort = place.gone.nBoxPort;  // what was taken away there is gone only when all of it is applied
+    }
+    places.rows[place.key] = std::move(made);
     return blNews;
 }
 

@@ -19,6 +19,7 @@ constexpr std::pair<std::string_view, const char*> kWhy[] = {
     {"728", "the router's table of ports is full"},
     {"729", "the router uses this port itself, or forwards it by a setting of its own"},
     {"lost", "the router said yes and does not keep it; its table may be full"},
+    {"kept", "the router says yes to its removal, and keeps it"},
     {"invalid", "the rule's router and box ports cannot be paired"},
     {"cut",
      "the list of ports is so long that it may have lost its end, and the last of them are not asked for; write it as "

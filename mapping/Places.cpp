@@ -4,6 +4,7 @@
 #include <algorithm>
 #include <iterator>
 #include <set>
+#include <utility>
 
 #include "ground/Marks.h"
 
@@ -88,6 +89,7 @@ void Places::LookAtTable() {
     for (const RouterMapping& entry : rgTable) {
         Show(entry, At(KeyOf(entry)));
     }
+    nListed = reply.IsOk() ? rgTable.size() : 0;
 }
 
 // A router that shows nothing: what it has granted, and what has not run out since, is what there is while it answers.
@@ -147,7 +149,7 @@ void Places::LookAt(PlaceList& rgpPlaces) {
     rgpPlaces.resize(nLooked);
 }
 
-void Places::LookAtRanges(PlaceList rgpPlaces) {
+void Places::LookAtRanges(PlaceList rgpPlaces, const std::function<void(Place&)>& fnCovered) {
     std::sort(rgpPlaces.begin(), rgpPlaces.end(),
               [](const Place* pOne, const Place* pOther) { return pOne->key < pOther->key; });
     bool blShows = true;
@@ -160,11 +162,58 @@ void Places::LookAtRanges(PlaceList rgpPlaces) {
             const uint16_t nLast = (*std::prev(end))->key.second;
             std::vector<RouterMapping> rgShown;
             blShows = guard.Note(router.ListRange(first.first, first.second, nLast, rgShown)).IsOk();
+            if (blShows) {
+                std::for_each(it, end, [&](Place* pPlace) { fnCovered(*pPlace); });
+            }
             for (const RouterMapping& entry : rgShown) {
                 Show(entry, At(KeyOf(entry)));
             }
         }
         it = end;
+    }
+}
+
+// One listing, where most of the table was taken away. What others take away or make meanwhile moves the entries, so
+// that it proves something only if it is as long as it is to be.
+bool Places::IsListedWithout(const PlaceList& rgpPlaces) {
+    if (nListed < rgpPlaces.size() || nListed - rgpPlaces.size() >= rgpPlaces.size()) {
+        return false;
+    }
+    std::vector<RouterMapping> rgTable;
+    const bool blShown = guard.Note(router.List(rgTable)).IsOk();
+    const bool blWithout = blShown && rgTable.size() == std::exchange(nListed, rgTable.size()) - rgpPlaces.size();
+    for (const RouterMapping& entry : rgTable) {
+        Show(entry, At(KeyOf(entry)));
+    }
+    return blWithout;
+}
+
+void Places::LookForGone(const PlaceList& rgpPlaces) {
+    if (rgpPlaces.empty() || guard.IsOver()) {
+        return;
+    }
+    const bool blForm = what.blForm;  // one look reads the list for all
+    for (Place* pPlace : rgpPlaces) {
+        pPlace->enSeen = Seen::kUnknown;
+    }
+    const auto fnAbsent = [](Place& place) { place.enSeen = Seen::kAbsent; };
+    if (!blForm) {
+        LookAtRanges(rgpPlaces, fnAbsent);
+    }
+    PlaceList rgpOpen;
+    std::copy_if(rgpPlaces.begin(), rgpPlaces.end(), std::back_inserter(rgpOpen),
+                 [](const Place* pPlace) { return pPlace->enSeen == Seen::kUnknown; });
+    if (!blForm && !rgpOpen.empty() && rgpOpen.size() == rgpPlaces.size() && IsListedWithout(rgpOpen)) {
+        std::for_each(rgpOpen.begin(), rgpOpen.end(), [&](Place* pPlace) {
+            if (pPlace->enSeen == Seen::kUnknown) {
+                fnAbsent(*pPlace);
+            }
+        });
+    }
+    for (Place* pPlace : rgpOpen) {
+        if (pPlace->enSeen == Seen::kUnknown && !guard.IsOver()) {
+            Look(*pPlace);
+        }
     }
 }
 

@@ -4,6 +4,7 @@
 // router.
 #pragma once
 
+#include <functional>
 #include <limits>
 #include <map>
 #include <vector>
@@ -18,12 +19,14 @@ struct Place {
     const RouterMapping* pWanted = nullptr;
     Seen enSeen = Seen::kUnknown;
     RouterMapping entry = {};
-    bool blWritten = false;     // asked for in this pass, and not read back yet
-    bool blUnrecorded = false;  // what was to be asked for cannot be put on record
-    bool blReplaced = false;    // taken away, because the router said yes to a change and did not make it
-    RouterReply kept = {};      // the router's word for what it did not take away
-    RouterReply answer = {};    // to the last asking for it
-    const char* szWhy = "";     // it was asked for
+    bool blWritten = false;      // asked for in this pass, and not read back yet
+    bool blUnrecorded = false;   // what was to be asked for cannot be put on record
+    bool blReplaced = false;     // taken away, because the router said yes to a change and did not make it
+    RouterReply kept = {};       // the router's word for what it did not take away
+    RouterMapping gone = {};     // what was taken away, as it was known
+    const char* szWhyGone = "";  // it was taken away
+    RouterReply answer = {};     // to the last asking for it
+    const char* szWhy = "";      // it was asked for
     Verdict verdict = {};
 };
 using PlaceList = std::vector<Place*>;
@@ -45,8 +48,13 @@ struct Places {
     RouterReply Look(Place& place);
     // Drops those for which there was no time: a slow router's pass is for doing something, too.
     void LookAt(PlaceList& rgpPlaces);
-    // What the router shows of the places, where it can show ranges; may be incomplete.
-    void LookAtRanges(PlaceList rgpPlaces);
+    // What the router shows of the places, where it can show ranges; may be incomplete. fnCovered: is told of each
+    // place of a range that was shown.
+    void LookAtRanges(
+        PlaceList rgpPlaces, const std::function<void(Place&)>& fnCovered = [](Place&) {});
+    // Whether what was taken away is gone: of each place it is known afterwards, as far as the router says. Places that
+    // it no longer shows together with others are not asked for one by one.
+    void LookForGone(const PlaceList& rgpPlaces);
 
     void Wake(int64_t nAt) { nNext = std::min(nNext, nAt); }
     int64_t Now() const { return around.fnNow(); }
@@ -62,9 +70,11 @@ struct Places {
     PassGuard guard;
     int64_t nNext = kNever;  // when something has to be done again
     std::map<MappingKey, Place> mapPlaces;
+    size_t nListed = 0;  // entries, where the table was shown to its end
 
 private:
     void Show(const RouterMapping& entry, Place& place);
+    bool IsListedWithout(const PlaceList& rgpPlaces);
     void Recall();
 };
 

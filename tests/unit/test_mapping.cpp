@@ -7,6 +7,7 @@
 #include <fstream>
 #include <iterator>
 #include <map>
+#include <optional>
 #include <set>
 #include <tuple>
 
@@ -71,7 +72,9 @@ public:
         if (mNRemoveCode != tavo::kWireOk) {
             return IgdReply(mNRemoveCode);
         }
-        return IgdReply(mMapTable.erase(tavo::KeyOf(mapping)) == 1 ? int{tavo::kWireOk} : int{tavo::kIgdNoSuchEntry});
+        const bool blThere =
+            mBlKeepsRemoved ? mMapTable.contains(tavo::KeyOf(mapping)) : mMapTable.erase(tavo::KeyOf(mapping)) == 1;
+        return IgdReply(blThere ? int{tavo::kWireOk} : int{tavo::kIgdNoSuchEntry});
     }
 
     RouterMapping& Put(const RouterMapping& mapping) { return mMapTable[tavo::KeyOf(mapping)] = mapping; }
@@ -84,8 +87,9 @@ public:
     std::string mSzRewritten;  // what every description becomes
     int mNRangeCode = tavo::kIgdInvalidAction;
     int mNRemoveCode = tavo::kWireOk;
-    int mNHidden = 0;     // not shown in a range
-    int mNSwallowed = 0;  // promised and not kept
+    bool mBlKeepsRemoved = false;  // says yes
+    int mNHidden = 0;              // not shown in a range
+    int mNSwallowed = 0;           // promised and not kept
     int mNCalls = 0;
 };
 
@@ -94,6 +98,8 @@ constexpr char kBox[] = "192.168.1.5";
 RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, const char* szText) {
     return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
 }
+
+using Rows = std::vector<std::string>;
 
 // Each outcome in one text: its name, its word, whose doing it is, and what else is known of it.
 std::vector<std::string> Texts(const tavo::PassResult& result) {
@@ -116,13 +122,15 @@ struct Core {
         record.TurnTo({"192.168.1.1", szHardware});
         return tavo::BringInLine(
             router, rgWanted, record, habit,
-            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0 && !blDiskFull; }});
+            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0 && !blDiskFull; },
+             [this](const RouterMapping&, const tavo::Step&) { ++nTold; }});
     }
     std::string szBox = kBox;
     tavo::Record record{"", "boot"};
     tavo::Habits habit;
     int64_t nNow = 1000;
     int nSaves = 0;
+    int nTold = 0;
     bool blDiskFull = false;
 };
 
@@ -226,7 +234,7 @@ TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
 // The pages of a router: entries are ranges, none is changed in place, and what was done takes effect together.
 class FormRouter : public MemoryRouter {
 public:
-    tavo::Abilities What() const override { return {.szConflict = "taken", .blForm = true}; }
+    tavo::Abilities What() const override { return {.blShows = mBlShows, .szConflict = "taken", .blForm = true}; }
     const RouterMapping* InTheWay(const RouterMapping& mapping) const {
         for (const auto& [key, entry] : mMapTable) {
             if (entry.nRouterPort <= mapping.nRouterPort + mapping.nMore &&
@@ -249,20 +257,36 @@ public:
             mMapInTheWay[tavo::KeyOf(mapping)] = *pEntry;
             return {tavo::Reply::kConflict, "taken"};
         }
+        BeforeChange();
         return MemoryRouter::Add(mapping);
     }
     RouterReply Remove(const RouterMapping& mapping) override {
+        BeforeChange();
         mMapTable.erase({"TCP", mNTornAway});
-        return MemoryRouter::Remove(mapping);
+        const auto it = mMapTable.find(tavo::KeyOf(mapping));
+        return !mBlShows && it != mMapTable.end() && it->second.nBoxPort != mapping.nBoxPort
+                   ? RouterReply{tavo::Reply::kNoSuchEntry, "no such rule"}
+                   : MemoryRouter::Remove(mapping);
     }
     RouterReply Apply() override {
         ++mNApplied;
+        if (!mBlApplies && mMapBefore) {
+            mMapTable = *mMapBefore;
+        }
+        mMapBefore.reset();
         return mBlApplies ? RouterReply{} : RouterReply{tavo::Reply::kRefused, "not applied"};
+    }
+    void BeforeChange() {
+        if (!mMapBefore) {
+            mMapBefore = mMapTable;
+        }
     }
 
     std::map<tavo::MappingKey, RouterMapping> mMapInTheWay;
+    bool mBlShows = true;
     bool mBlApplies = true;
-    uint16_t mNTornAway = 0;  // goes with any other one
+    std::optional<std::map<tavo::MappingKey, RouterMapping>> mMapBefore;  // what is there if that is not applied
+    uint16_t mNTornAway = 0;                                              // goes with any other one
     int mNApplied = 0;
 };
 
@@ -280,15 +304,17 @@ TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
         std::vector<std::string> rgExpected;
     };
     const std::string szTaken = "30-32/tcp taken 192.168.1.9 tavo:theirs";
-    for (const Case& row : {Case{"all is well", true, 0, {"1/tcp 1", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}},
-                            Case{"nothing takes effect",
-                                 false,
-                                 0,
-                                 {"1/tcp not applied", "10-11/tcp not applied", "20/tcp not applied", szTaken}},
-                            Case{"another one goes with what is taken away",
-                                 true,
-                                 1,
-                                 {"1/tcp lost", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}}}) {
+    for (const Case& row :
+         {Case{"all is well", true, 0, {"1/tcp 1", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}},
+          Case{"nothing takes effect",
+               false,
+               0,
+               {"1/tcp not applied", "10-11/tcp not applied", "20/tcp not applied", szTaken,
+                "10-11/tcp not applied left over", "20/tcp not applied left over", "50-51/tcp not applied left over"}},
+          Case{"another one goes with what is taken away",
+               true,
+               1,
+               {"1/tcp lost", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}}}) {
         SCOPED_TRACE(row.szWhat);
         FormRouter router;
         for (const RouterMapping& mapping :
@@ -304,11 +330,36 @@ TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
                                               Entry(20, 20, "", "tavo:c"), Range(Entry(30, 30, "", "tavo:d"), 2)});
         EXPECT_EQ(Texts(result), row.rgExpected);
         EXPECT_EQ(router.mNApplied, 1);
-        EXPECT_EQ((router.mMapTable[{"TCP", 10}].nMore), 1);
+        EXPECT_EQ((router.mMapTable[{"TCP", 10}].nMore), row.blApplies ? 1 : 5);
         EXPECT_EQ((router.mMapTable[{"TCP", 31}].nMore), 9);
-        EXPECT_FALSE((router.mMapTable.contains({"TCP", 50})));
+        EXPECT_NE((router.mMapTable.contains({"TCP", 50})), row.blApplies);
+        EXPECT_NE((core.record.Here().contains({"TCP", 50})), row.blApplies);
         EXPECT_FALSE((core.record.Here().contains({"TCP", 30}))) << "what could not be made is nothing of ours";
         EXPECT_EQ((core.record.Here()[{"TCP", 10}].nMore), 1);
+    }
+}
+
+// What was not applied is gone, and what was taken away there is open still, until another run closes it.
+TEST(Mapping, AFormHasDoneNothingUntilItIsApplied) {
+    for (const bool blShows : {true, false}) {
+        SCOPED_TRACE(blShows ? "with a list" : "without a list");
+        FormRouter router;
+        router.mBlShows = blShows;
+        router.mSzRewritten = "-";
+        Core core;
+        core.habit.nLease = 0;
+        core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b"), Entry(4, 4, "", "tavo:c")});
+        const auto mapBefore = router.mMapTable;
+        ASSERT_EQ(mapBefore.size(), 3U);
+        router.mBlApplies = false;
+        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b"), Entry(4, 9, "", "tavo:c")})),
+                  (std::vector<std::string>{"2/tcp not applied", "4/tcp not applied", "1/tcp not applied left over",
+                                            "4/tcp not applied left over"}));
+        ASSERT_EQ(router.mMapTable.size(), 3U);
+        router.mBlApplies = true;
+        EXPECT_EQ(core.Run(router, {Entry(2, 2, "", "tavo:b")}).rgOutcomes.size(), 1U);
+        EXPECT_EQ(router.mMapTable.size(), 1U);
+        EXPECT_EQ(core.record.Here().size(), 1U);
     }
 }
 
@@ -348,6 +399,50 @@ TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
     router.Put(Entry(2, 9, kBox, "tavo:moved"));
     router.mNRemoveCode = 606;
     EXPECT_EQ(Texts(Core().Run(router, {})), (std::vector<std::string>{"1/tcp 606 left over", "2/tcp 606 left over"}));
+}
+
+// Some say yes and keep it, for ever or for a while; another's yes is as good as what it shows.
+TEST(Mapping, AYesToARemovalIsLookedAt) {
+    for (const int nListCode : {static_cast<int>(tavo::kWireOk), 401}) {
+        MemoryRouter router;
+        router.mNListCode = nListCode;
+        router.mSzRewritten = "upnp";
+        Core core;
+        core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")});
+        router.mBlKeepsRemoved = true;
+        for (int i = 0; i < 2; ++i) {
+            core.nTold = 0;
+            EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})),
+                      (std::vector<std::string>{"2/tcp 1", "1/tcp kept left over"}));
+            EXPECT_TRUE((core.record.Here().contains({"TCP", 1})));
+            EXPECT_EQ(core.nTold, 0) << "nothing has changed";
+        }
+        router.mMapTable.erase({"TCP", 1});
+        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
+        EXPECT_FALSE((core.record.Here().contains({"TCP", 1})));
+    }
+}
+
+TEST(Mapping, ALookAtManyRemovalsCostsLittle) {
+    // What a range answers, how many entries there are, and what a pass costs that takes away ten of them.
+    const std::tuple<int, int, int> rgCases[] = {{tavo::kWireOk, 30, 1 + 10 + 1},
+                                                 {tavo::kIgdInvalidAction, 30, 1 + 10 + 1 + 10},
+                                                 {tavo::kIgdInvalidAction, 10, 1 + 10 + 1 + 1},
+                                                 {tavo::kWireOk, 10, 1 + 10 + 1}};
+    for (const auto& [nRangeCode, nEntries, nCalls] : rgCases) {
+        for (const bool blKeeps : {false, true}) {
+            MemoryRouter router;
+            router.mNRangeCode = nRangeCode;
+            for (int i = 1; i <= nEntries; ++i) {
+                const auto nPort = static_cast<uint16_t>(i);
+                router.Put(Entry(nPort, nPort, i <= 10 ? kBox : "192.168.1.9", i <= 10 ? "tavo:a" : "game"));
+            }
+            router.mBlKeepsRemoved = blKeeps;
+            const auto result = Core().Run(router, {});
+            EXPECT_EQ(result.rgOutcomes.size(), blKeeps ? 10U : 0U);
+            EXPECT_EQ(router.mNCalls, nCalls) << nRangeCode << " " << nEntries;
+        }
+    }
 }
 
 // Where the whole table cannot be read, our own places are asked for; where nothing makes sense, nothing is said of
@@ -704,8 +799,6 @@ private:
         });
     }
 };
-
-using Rows = std::vector<std::string>;
 
 // Two routers at one address: where the one had another place to give, the other has lent the place that was asked for.
 TEST(Mapping, WhatOneRouterGaveElsewhereSaysNothingOfAnother) {
