@@ -436,11 +436,8 @@ void Carrier::Confirm(Place& place) {
     } else if (place.enSeen == Seen::kPresent && place.entry.szClient != Box()) {
         place.verdict = InTheWay(mPlaces, place.entry);
         Forget(place);
-    } else {
+    } else {  // or only slow to show it: it stays on record, as one that was not shown
         place.verdict = {PortState::kRefused, kLost};
-        if (reply.enReply == Reply::kNoSuchEntry) {
-            Forget(place);
-        }
     }
 }
 

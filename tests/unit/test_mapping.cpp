@@ -534,6 +534,36 @@ TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
     }
 }
 
+// With a text of its own, by which nobody knows whose it is.
+TEST(Mapping, WhatIsShownOnlyAfterAWhileIsOurs) {
+    class Slow : public MemoryRouter {
+    public:
+        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+            return mBlShows ? MemoryRouter::Get(szProtocol, nPort, mapping) : IgdReply(tavo::kIgdNoSuchEntry);
+        }
+        bool mBlShows = false;
+    };
+    for (const bool blWanted : {true, false}) {
+        Slow router;
+        Core core;
+        router.mSzRewritten = "upnp";
+        const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
+        EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp lost"});
+        router.mBlShows = true;
+        if (blWanted) {
+            EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp 1"});
+        }
+        core.Run(router, {});
+        EXPECT_TRUE(router.mMapTable.empty());
+        EXPECT_TRUE(core.record.Here().empty());
+
+        router.mNSwallowed = 1;
+        EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp lost"});
+        core.Run(router, {});
+        EXPECT_TRUE(core.record.Here().empty()) << "a later look has shown nothing";
+    }
+}
+
 // The change was asked for, the process died, the router restarted, and another program has the place.
 TEST(Mapping, ATextThatTheRouterGivesToEverybodysProvesNothing) {
     MemoryRouter router;
