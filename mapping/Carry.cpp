@@ -281,6 +281,10 @@ bool Carrier::Renew(Place& place) {
 bool Carrier::Unrecorded(Place& place) {
     if (place.blUnrecorded) {
         place.verdict = {PortState::kRefused, kUnrecorded};
+        if (place.enSeen == Seen::kPresent && IsOurs(place.entry, mPlaces.MadeAt(place), Box())) {
+            place.verdict.szWhy = "it still leads to port " + std::to_string(place.entry.nBoxPort) + " of " +
+                                  place.entry.szClient + ", as before: " + WhyOf(place.verdict);
+        }
         mPlaces.Wake(mPlaces.Now() + kRecordAgain);
     }
     return place.blUnrecorded;

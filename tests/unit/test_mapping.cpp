@@ -604,6 +604,20 @@ TEST(Mapping, AnAnswerThatIsLostIsAskedForAgainSoon) {
     EXPECT_EQ(result.nNextSeconds, 10);
 }
 
+// What is to lead elsewhere cannot be noted down, so that it goes on as it was: that is said of the port.
+TEST(Mapping, WithoutARecordAPortThatIsOpenIsNamedAsItIs) {
+    MemoryRouter router;
+    Core core;
+    core.Run(router, {Entry(1, 7, "", "tavo:a")});
+    core.blDiskFull = true;
+    const auto result = core.Run(router, {Entry(1, 2, "", "tavo:a"), Entry(3, 3, "", "tavo:b")});
+    EXPECT_EQ(Texts(result), (Rows{"1/tcp unrecorded", "3/tcp unrecorded"}));
+    EXPECT_TRUE(
+        WhyOf(result.rgOutcomes[0].verdict).starts_with("it still leads to port 7 of 192.168.1.5, as before: "));
+    EXPECT_TRUE(WhyOf(result.rgOutcomes[1].verdict).starts_with("this box cannot note down"));
+    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 7);
+}
+
 // Each look takes a second, and a pass has a hundred and fifty: the next one goes on where it ended, and what is not
 // reached yet is unknown, at a router that answers.
 TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
