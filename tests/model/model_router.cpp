@@ -9,6 +9,7 @@ namespace model {
 namespace {
 
 constexpr size_t kFirstEntries = 3;  // that a listing shows before it ends in a fault
+constexpr int64_t kSlow = 3;         // seconds until a change is shown
 
 }  // namespace
 
@@ -53,6 +54,36 @@ tavo::RouterMapping Router::Shown(const Entry& entry) const {
     return shown;
 }
 
+std::map<tavo::MappingKey, tavo::RouterMapping> Router::View() const {
+    std::map<tavo::MappingKey, tavo::RouterMapping> mapView;
+    for (const auto& [key, entry] : mMapTable) {
+        if (!habits.blSlowToShow || !entry.blBox || mNNow - entry.nMade >= kSlow) {
+            mapView.emplace(key, Shown(entry));
+        }
+    }
+    for (const auto& [key, gone] : mMapGone) {
+        if (habits.blSlowToHide && mNNow - gone.first < kSlow && !mMapTable.contains(key)) {
+            mapView.emplace(key, Shown(gone.second));
+        }
+    }
+    return mapView;
+}
+
+void Router::BeforeChange() {
+    mBlListed = false;
+    mBlChanged = true;
+    if (habits.blApply && !mMapBefore) {
+        mMapBefore = mMapTable;
+    }
+}
+
+void Router::EndRun() {
+    if (mMapBefore) {
+        mMapTable = std::move(*mMapBefore);
+        mMapBefore.reset();
+    }
+}
+
 Reply Router::ReadForm() {
     if (mBlListed || habits.blMute) {
         return {};
@@ -79,9 +110,16 @@ Reply Router::FormGet(const tavo::MappingKey& key, tavo::RouterMapping& mapping)
     return {};
 }
 
-// Half done is what the answers to adding and deleting say: what is asked here may be lost like any other answer.
+// Once for what was done before; the answer is that of the last time.
 Reply Router::Apply() {
-    return std::exchange(mBlChanged, false) ? Answer([] { return Reply{}; }) : Reply{};
+    if (std::exchange(mBlChanged, false)) {
+        mBlListed = false;
+        mApplied = Answer([this] {
+            mMapBefore.reset();
+            return Reply{};
+        });
+    }
+    return mApplied;
 }
 
 Reply Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
@@ -98,12 +136,12 @@ Reply Router::List(std::vector<tavo::RouterMapping>& rgMappings) {
         return mAsked;
     }
     return Answer([&]() -> Reply {
-        for (const auto& [key, entry] : mMapTable) {
+        for (const auto& [key, shown] : View()) {
             if (habits.enList != tavo::Reply::kOk && rgMappings.size() >= kFirstEntries) {
                 break;
             }
             if (habits.enList <= tavo::Reply::kTooLong && !Chance(nSkipPerMille)) {
-                rgMappings.push_back(Shown(entry));
+                rgMappings.push_back(shown);
             }
         }
         return {habits.enList, "list"};
@@ -116,10 +154,9 @@ Reply Router::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t
         return {tavo::Reply::kRefused, "401"};
     }
     return Answer([&]() -> Reply {
-        for (const auto& [key, entry] : mMapTable) {
-            if (key.first == szProtocol && key.second >= nFirst && key.second <= nLast &&
-                entry.mapping.szClient == szBox) {
-                rgMappings.push_back(Shown(entry));
+        for (const auto& [key, shown] : View()) {
+            if (key.first == szProtocol && key.second >= nFirst && key.second <= nLast) {
+                rgMappings.push_back(shown);
             }
         }
         return {};
@@ -131,11 +168,12 @@ Reply Router::Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::Rou
         return FormGet({szProtocol, nRouterPort}, mapping);
     }
     return Answer([&]() -> Reply {
-        const Entry* pEntry = At({szProtocol, nRouterPort});
-        if (pEntry == nullptr) {
+        const auto mapView = View();
+        const auto it = mapView.find({szProtocol, nRouterPort});
+        if (it == mapView.end()) {
             return {tavo::Reply::kNoSuchEntry, "714"};
         }
-        mapping = Shown(*pEntry);
+        mapping = it->second;
         return {};
     });
 }
@@ -163,7 +201,8 @@ Reply Router::DoAdd(const tavo::RouterMapping& mapping) {
     } else if (mMapTable.size() >= habits.nCapacity) {
         return habits.blSaysFull ? Reply{tavo::Reply::kRefused, "728"} : Reply{};
     }
-    Entry& entry = mMapTable[key] = {mapping, 0, true};
+    const int64_t nMade = pThere != nullptr ? pThere->nMade : mNNow;
+    Entry& entry = mMapTable[key] = {mapping, 0, true, false, nMade};
     if (habits.nLongestLease != 0 && (mapping.nLease == 0 || mapping.nLease > habits.nLongestLease)) {
         entry.mapping.nLease = habits.nLongestLease;
     }
@@ -205,8 +244,7 @@ Reply Router::Add(tavo::RouterMapping& mapping) {
         szBroken = "a mapping for another host is asked for";
     }
     fnBeforeAdd(mapping);
-    mBlListed = false;
-    mBlChanged = true;
+    BeforeChange();
     const Reply reply = Answer([&] { return habits.blBlind ? DoGrant(mapping) : DoAdd(mapping); });
     fnTell("add " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " -> " + mapping.szClient + ":" +
            std::to_string(mapping.nBoxPort) + " = " + reply.szWord);
@@ -228,13 +266,16 @@ Reply Router::DoRemove(const tavo::RouterMapping& mapping) {
     if (!pEntry->blBox && !pEntry->blOrphan) {
         szBroken = "somebody else's mapping is taken away";
     }
-    mMapTable.erase(tavo::KeyOf(pEntry->mapping));
+    if (!habits.blKeepsRemoved) {
+        const tavo::MappingKey key = tavo::KeyOf(pEntry->mapping);
+        mMapGone.insert_or_assign(key, std::pair(mNNow, *pEntry));
+        mMapTable.erase(key);
+    }
     return {};
 }
 
 Reply Router::Remove(const tavo::RouterMapping& mapping) {
-    mBlListed = false;
-    mBlChanged = true;
+    BeforeChange();
     const bool blForeign = habits.blBlind && mapping.szClient != szBox;
     const Reply reply = blForeign ? Reply{tavo::Reply::kRefused, "former"} : Answer([&] { return DoRemove(mapping); });
     fnTell("remove " + mapping.szProtocol + std::to_string(mapping.nRouterPort) + " = " + reply.szWord);

@@ -5,8 +5,10 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <optional>
 #include <random>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "mapping/Record.h"
@@ -35,9 +37,13 @@ struct Habits {
     // Shows nothing, lends everything, gives another port where the wanted one is taken, and knows a mapping by its
     // client and the client's port.
     bool blBlind = false;
+    bool blKeepsRemoved = false;  // says yes to a removal, and keeps the entry
+    bool blSlowToHide = false;    // shows an entry for some seconds after it was taken away
+    bool blSlowToShow = false;    // shows a new one only some seconds after it was made
     // The router's own pages: no leases, an entry is never changed in place, the box reads the list once and after each
     // change, and begins anew for each pass, with the record from the disk.
     bool blForm = false;
+    bool blApply = false;        // of a form: what was done is lost unless it is applied
     bool blMute = false;         // of a form: it shows no list
     bool blHidesClient = false;  // of a form: the list does not show whom an entry is for
 };
@@ -51,6 +57,7 @@ public:
         int64_t nEnd = 0;       // 0: never
         bool blBox = false;     // made by the code under test
         bool blOrphan = false;  // was made by it, and nobody can know that any more
+        int64_t nMade = 0;
     };
 
     tavo::Abilities What() const override {
@@ -78,9 +85,15 @@ public:
     // What is there now, without asking.
     const Entry* At(const tavo::MappingKey& key);
     // Another process asks now.
-    void NewRun() { mBlListed = mBlChanged = false; }
+    void NewRun() {
+        mBlListed = mBlChanged = false;
+        mApplied = {};
+    }
+    // It asks for nothing more.
+    void EndRun();
     void Restart() {
         mMapTable.clear();
+        mMapGone.clear();
         ++nLife;
     }
 
@@ -110,12 +123,19 @@ private:
     // A form's list as the box has it, read where that is needed.
     Reply ReadForm();
     Reply FormGet(const tavo::MappingKey& key, tavo::RouterMapping& mapping);
+    // What it shows, which may not be all that there is.
+    std::map<tavo::MappingKey, tavo::RouterMapping> View() const;
+    // What is there before a form is changed.
+    void BeforeChange();
     const Entry* OfBoxPort(const tavo::RouterMapping& mapping) const;
 
     Reply mAsked;
     bool mBlListed = false;   // the box has a form's list, and it is not out of date
     bool mBlChanged = false;  // a form has done something that has not been applied
+    Reply mApplied;
     std::map<tavo::MappingKey, tavo::RouterMapping> mMapListed;
+    std::map<tavo::MappingKey, std::pair<int64_t, Entry>> mMapGone;  // with when it was taken away
+    std::optional<std::map<tavo::MappingKey, Entry>> mMapBefore;     // a form's, without what was not applied
     std::mt19937& mRandom;
     const int64_t& mNNow;
 };

@@ -49,11 +49,15 @@ public:
         habits.blBlind = OneIn(4);
         habits.blSecure = habits.blSecure || habits.blBlind;
         habits.blForgetsLease = habits.blForgetsLease && !habits.blBlind;
+        habits.blKeepsRemoved = OneIn(12) && !habits.blBlind;
+        habits.blSlowToHide = OneIn(6) && !habits.blBlind;
+        habits.blSlowToShow = OneIn(6) && !habits.blBlind;
         if (OneIn(5)) {
             habits = {.blPermanentOnly = true, .nText = OneIn(2) ? 0 : 2, .blForm = true, .blMute = OneIn(3)};
             habits.blHidesClient = !habits.blMute && OneIn(3);
             habits.nCapacity = OneIn(4) ? 4 + Pick(8) : 1000;
             habits.blSaysFull = habits.blMute || OneIn(2);
+            habits.blApply = OneIn(2);
         }
         // Nothing tells two routers apart whose lists leave out everything.
         mBlHardware = !OneIn(5) || habits.blHidesClient;
@@ -162,7 +166,8 @@ private:
                 Tell(mBlDiskFull ? "disk full" : "disk has room");
                 break;
             case 13:
-                mRouter.nSkipPerMille = mRouter.nSkipPerMille == 0 ? 200 : 0;
+                // Of one that lies about a removal, too, a short listing would be the only witness.
+                mRouter.nSkipPerMille = mRouter.nSkipPerMille == 0 && !mRouter.habits.blKeepsRemoved ? 200 : 0;
                 Tell("entries left out of listings: " + std::to_string(mRouter.nSkipPerMille));
                 break;
             case 14:
@@ -243,6 +248,7 @@ private:
                                        {mRouter.szBox, [this] { return mNNow - mNBootAt; },
                                         [this] { return mNStopIn > 0 && --mNStopIn == 0; }, [this] { return Save(); }});
         } catch (const model::Killed&) {
+            mRouter.EndRun();
             mRouter.nKillPerMille = 0;
             mNStopIn = 0;
             Tell("killed");
@@ -250,6 +256,7 @@ private:
             CheckStrangers(mapBefore);
             return;
         }
+        mRouter.EndRun();
         mRouter.nKillPerMille = 0;
         mNStopIn = 0;
         const bool blWell = result.transport.IsOk() && !result.blStopped;
@@ -359,7 +366,7 @@ private:
             if (verdict.enState == tavo::PortState::kOpen && !blThere) {
                 Broken("said to be open and is not", key);
             }
-            if (!blTrouble && verdict.szWord == "lost" && blThere) {
+            if (!blTrouble && verdict.szWord == "lost" && blThere && !mRouter.habits.blSlowToShow) {
                 Broken("said to be lost and is there", key);
             }
             if (mBlQuiet && !blTrouble && verdict.blAnew && mSetOpen.contains(key) && !mRouter.habits.blForgetsLease &&
@@ -412,8 +419,13 @@ private:
                             [&](const RouterMapping& earlier) {
                                 return earlier.szProtocol == key.first && earlier.nBoxPort == mRgWanted[i].nBoxPort;
                             });
+            // What it says that it took away is in the way.
+            const bool blInTheWay =
+                mRouter.habits.blKeepsRemoved && pEntry != nullptr &&
+                (pEntry->mapping.szClient != mRouter.szBox || pEntry->mapping.nBoxPort != mRgWanted[i].nBoxPort);
+            const bool blNotShownYet = mRouter.habits.blSlowToShow && pEntry != nullptr && pEntry->nMade == mNNow;
             const bool blForgone = mBlDiskFull && result.rgOutcomes[i].verdict.szWord == tavo::kUnrecorded;
-            if (blFree && !blWaits && !blShared && !blForgone &&
+            if (blFree && !blInTheWay && !blNotShownYet && !blWaits && !blShared && !blForgone &&
                 result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
                 Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
             }
@@ -422,7 +434,8 @@ private:
             const bool blOurs = entry.blBox && mRouter.At(key) != nullptr;
             const bool blWanted = std::any_of(mRgWanted.begin(), mRgWanted.end(),
                                               [&](const RouterMapping& wanted) { return tavo::KeyOf(wanted) == key; });
-            if (blOurs && !blWanted && (!mRouter.habits.blSecure || entry.mapping.szClient == mRouter.szBox)) {
+            if (blOurs && !blWanted && !mRouter.habits.blKeepsRemoved &&
+                (!mRouter.habits.blSecure || entry.mapping.szClient == mRouter.szBox)) {
                 Broken("outlives its rule", key);
             }
         }
