@@ -72,23 +72,26 @@ private:
 bool Carrier::Remove(Place& place, const char* szWhy) {
     place.gone = mPlaces.Known(place);
     place.szWhyGone = szWhy;
+    place.before.reset();
     RouterReply reply = Note(mPlaces.router.Remove(place.gone));
     const Made* pMade = mPlaces.MadeAt(place);
     if (mPlaces.what.blForm && !mPlaces.what.blShows && reply.enReply == Reply::kNoSuchEntry && pMade != nullptr &&
-        pMade->nOtherPort != 0) {  // the change of it may not have been applied
-        place.gone.nBoxPort = pMade->nOtherPort;
+        pMade->other.nBoxPort != 0) {  // the change of it may not have been applied
+        place.gone.szClient = pMade->other.szClient;
+        place.gone.nBoxPort = pMade->other.nBoxPort;
         reply = Note(mPlaces.router.Remove(place.gone));
     }
     if (!reply.IsOk() && reply.enReply != Reply::kNoSuchEntry) {
         place.kept = std::move(reply);
         return false;
     }
-    const bool blProof = reply.IsOk() && (mPlaces.what.blForm || (mPlaces.what.blShows && place.pWanted == nullptr));
-    if (blProof) {
-        mPlaces.rows.try_emplace(place.key, RowOf(place.gone, true, mPlaces.Now()));
-        mRgpGone.push_back(&place);
+    if (reply.IsOk() && (mPlaces.what.blForm || mPlaces.what.blShows)) {
+        place.before = mPlaces.rows.try_emplace(place.key, RowOf(place.gone, true, mPlaces.Now())).first->second;
+        if (mPlaces.what.blForm || place.pWanted == nullptr) {
+            mRgpGone.push_back(&place);
+        }
     }
-    if (!blProof || place.pWanted != nullptr) {
+    if (!place.before || place.pWanted != nullptr) {
         OnGone(place);
     }
     place.enSeen = Seen::kAbsent;
@@ -98,7 +101,7 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
 
 void Carrier::OnGone(Place& place) {
     mPlaces.around.fnTell(place.gone, {Action::kRemove, place.szWhyGone});
-    if (!mPlaces.what.blForm || place.pWanted == nullptr) {  // else it is asked for anew, and stays on record
+    if (!place.before || place.pWanted == nullptr) {  // else it is asked for anew, and stays on record
         Forget(place);
     }
 }
@@ -109,7 +112,7 @@ void Carrier::CheckGone() {
     PlaceList rgpGone = std::exchange(mRgpGone, {});
     std::erase_if(rgpGone, [this](const Place* pPlace) {  // what came of those shows in what was made in their place
         if (Made* pMade = mPlaces.MadeAt(*pPlace); pPlace->pWanted != nullptr && pMade != nullptr) {
-            pMade->nOtherPort = 0;
+            pMade->other = {};
         }
         return pPlace->pWanted != nullptr;
     });
@@ -256,6 +259,9 @@ bool Carrier::Do(Place& place, const Step& step) {
 }
 
 bool Carrier::Replace(Place& place, const char* szWhy) {
+    if (place.before) {  // it is there again, or still
+        place.kept = {Reply::kRefused, kKept};
+    }
     if (place.kept.IsOk() && Remove(place, szWhy)) {
         return true;
     }
@@ -338,9 +344,13 @@ void Carrier::OnMade(Place& place, const RouterMapping& mapping, int64_t nAsked,
     // Some say yes to a change, and leave the entry as it was.
     const bool blChange = mPlaces.what.blShows && place.enSeen == Seen::kPresent && blAnew;
     const Made* pMade = mPlaces.MadeAt(place);
-    const uint16_t nBefore = mPlaces.what.blForm && pMade != nullptr ? pMade->nOtherPort : uint16_t{0};
-    Made& made = mPlaces.rows[place.key] = RowOf(mapping, !mPlaces.what.blShows, nAsked);
-    made.nOtherPort = blChange ? place.entry.nBoxPort : nBefore;
+    Made made = RowOf(mapping, !mPlaces.what.blShows, nAsked);
+    if (blChange) {
+        made.other = {place.entry.szClient, place.entry.nBoxPort};
+    } else if (pMade != nullptr) {
+        made.other = pMade->other;
+    }
+    mPlaces.rows[place.key] = std::move(made);
     if (blAnew) {
         mPlaces.around.fnTell(mapping, {Action::kAdd, place.szWhy});
     }
@@ -372,12 +382,15 @@ void Carrier::OnElsewhere(Place& place, const RouterMapping& made, const RouterR
     }
 }
 
-// What was refused is not there, unless it was before.
+// What was refused is not there, unless it was before. Then it may be in the way still.
 void Carrier::OnRefused(Place& place, const RouterReply& reply) {
     place.verdict = RefusedBy(reply);
     const Made* pMade = mPlaces.MadeAt(place);
     if (reply.IsRefusal() && place.enSeen == Seen::kAbsent && pMade != nullptr && !pMade->blShown) {
         Forget(place);
+        if (place.before) {
+            mPlaces.rows.emplace(place.key, *place.before);
+        }
     }
 }
 
@@ -437,6 +450,9 @@ void Carrier::Confirm(Place& place) {
                !std::exchange(place.blReplaced, true) && Remove(place, "the router said yes to a change of it")) {
         place.verdict = {PortState::kRefused, kLost};
         Settle(place);
+    } else if (place.enSeen == Seen::kPresent && IsOurs(place.entry, mPlaces.MadeAt(place), Box())) {
+        place.kept = {Reply::kRefused, kKept};
+        place.verdict = StillHeld(mPlaces, place, place.kept);
     } else if (place.enSeen == Seen::kPresent && place.entry.szClient != Box()) {
         place.verdict = InTheWay(mPlaces, place.entry);
         Forget(place);

@@ -17,9 +17,9 @@ bool Intend(Places& places, const Place& place) {
     mapping.szClient = places.around.szBox;
     mapping.nLease = places.habit.blPermanentOnly ? 0 : places.habit.nLease;
     if (pMade != nullptr && place.enSeen == Seen::kPresent) {  // a change: it may lead to the one port or to the other
-        const bool blNews = pMade->blShown || pMade->nOtherPort != mapping.nBoxPort;
+        const bool blNews = pMade->blShown || pMade->other.nBoxPort != mapping.nBoxPort;
         pMade->blShown = false;
-        pMade->nOtherPort = mapping.nBoxPort;
+        pMade->other = {mapping.szClient, mapping.nBoxPort};
         return blNews;
     }
     // What was shown is known by its text from then on. One that the router gives to everybody's stays what it is.
@@ -28,8 +28,9 @@ bool Intend(Places& places, const Place& place) {
     const bool blNews = pMade == nullptr || pMade->szClient != mapping.szClient ||
                         pMade->nBoxPort != mapping.nBoxPort || pMade->nMore != mapping.nMore || blText;
     Made made = RowOf(mapping, false, places.Now());
-    if (places.what.blForm && place.gone.nBoxPort != made.nBoxPort) {
-        made.nOtherPort = place.gone.nBoxPort;  // what was taken away there is gone only when all of it is applied
+    // What was taken away there is gone when the new one is shown: a form has to be applied, and some only say yes.
+    if (place.before && (place.before->szClient != made.szClient || place.before->nBoxPort != made.nBoxPort)) {
+        made.other = {place.before->szClient, place.before->nBoxPort};
     }
     places.rows[place.key] = std::move(made);
     return blNews;

@@ -117,9 +117,10 @@ void Places::Show(const RouterMapping& entry, Place& place) {
     if (pMade == nullptr || !pMade->IsEntry(place.entry)) {
         return;
     }
+    pMade->szClient = place.entry.szClient;
     pMade->szText = entry.szDescription;
     pMade->nBoxPort = entry.nBoxPort;
-    pMade->nOtherPort = 0;
+    pMade->other = {};
     // How long a lease is shows right after it was granted; later listings show what is left of it, or nothing new.
     if (place.blWritten || !pMade->blShown) {
         pMade->nLease = pMade->nLease == 0 ? entry.nLease : std::min(pMade->nLease, entry.nLease);

@@ -7,6 +7,7 @@
 #include <functional>
 #include <limits>
 #include <map>
+#include <optional>
 #include <vector>
 
 #include "mapping/Pass.h"
@@ -19,14 +20,15 @@ struct Place {
     const RouterMapping* pWanted = nullptr;
     Seen enSeen = Seen::kUnknown;
     RouterMapping entry = {};
-    bool blWritten = false;      // asked for in this pass, and not read back yet
-    bool blUnrecorded = false;   // what was to be asked for cannot be put on record
-    bool blReplaced = false;     // taken away, because the router said yes to a change and did not make it
-    RouterReply kept = {};       // the router's word for what it did not take away
-    RouterMapping gone = {};     // what was taken away, as it was known
-    const char* szWhyGone = "";  // it was taken away
-    RouterReply answer = {};     // to the last asking for it
-    const char* szWhy = "";      // it was asked for
+    bool blWritten = false;           // asked for in this pass, and not read back yet
+    bool blUnrecorded = false;        // what was to be asked for cannot be put on record
+    bool blReplaced = false;          // taken away, because the router said yes to a change and did not make it
+    RouterReply kept = {};            // the router's word for what it did not take away
+    RouterMapping gone = {};          // what was taken away, as it was known
+    const char* szWhyGone = "";       // it was taken away
+    std::optional<Made> before = {};  // our record of it, where the router's yes to that is not all there is to see
+    RouterReply answer = {};          // to the last asking for it
+    const char* szWhy = "";           // it was asked for
     Verdict verdict = {};
 };
 using PlaceList = std::vector<Place*>;

@@ -53,7 +53,10 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
         const bool blCounts = blThisBoot && nAsked >= 0 && nAsked <= kMostSeconds;
         row.made.blBefore = !blCounts || mapValues["before"] == "yes";
         row.made.nAsked = blCounts ? nAsked : 0;
-        row.made.nOtherPort = NumberIn<uint16_t>(mapValues["other_port"]);
+        row.made.other = {mapValues["other_client"], NumberIn<uint16_t>(mapValues["other_port"])};
+        if (row.made.other.nBoxPort != 0 && row.made.other.szClient.empty()) {
+            row.made.other.szClient = row.made.szClient;  // earlier versions knew of no other client
+        }
         row.made.nMore = NumberIn<uint16_t>(mapValues["more"]);
         const bool blProtocol = row.key.first == "TCP" || row.key.first == "UDP" || row.key.first == "BOTH";
         const int nLast = std::max(row.key.second, row.made.nBoxPort) + row.made.nMore;
@@ -116,7 +119,8 @@ std::string Record::Text() const {
                                {"router_port", std::to_string(key.second)},
                                {"box_port", std::to_string(made.nBoxPort)},
                                {"more", std::to_string(made.nMore)},
-                               {"other_port", std::to_string(made.nOtherPort)},
+                               {"other_client", made.other.szClient},
+                               {"other_port", std::to_string(made.other.nBoxPort)},
                                {"client", made.szClient},
                                {"text", made.szText},
                                {"shown", made.blShown ? "yes" : "no"},

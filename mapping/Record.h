@@ -35,6 +35,12 @@ struct RouterName {
     }
 };
 
+// Where a mapping leads.
+struct Target {
+    std::string szClient;
+    uint16_t nBoxPort = 0;  // 0: nowhere
+};
+
 // One mapping of ours.
 struct Made {
     std::string szClient;  // the box's own address when it was made
@@ -44,8 +50,9 @@ struct Made {
     uint32_t nLease = 0;    // seconds from nAsked; 0: until the router restarts
     int64_t nAsked = 0;     // seconds of boot time; of an earlier boot: 0
     bool blBefore = false;  // asked for before this boot, or doubtful for another reason: to be asked for anew
-    // The other port that it may lead to: a change was asked for, and what came of it was not shown. 0: none.
-    uint16_t nOtherPort = 0;
+    // Where else it may lead: a change was asked for, or what was there before was taken away, and what came of that
+    // was not shown.
+    Target other = {};
     std::string szHardware = {};  // of the router that it was made at, where the one in front does not show its own
     uint16_t nMore = 0;           // of a range
 
@@ -54,9 +61,10 @@ struct Made {
     bool IsEntry(const RouterMapping& entry) const {
         const bool blPort = entry.nBoxPort == nBoxPort && entry.nMore == nMore;
         const bool blText = entry.szDescription == szText;
-        const bool blOther = nOtherPort != 0 && entry.nBoxPort == nOtherPort;
         const bool blMark = blText && szText.starts_with(kOwnPrefix);
-        return entry.szClient == szClient && (blShown ? blPort && blText : blPort || blOther || blMark);
+        const bool blThis = entry.szClient == szClient && (blShown ? blPort && blText : blPort || blMark);
+        const bool blOther = !blShown && entry.szClient == other.szClient && entry.nBoxPort == other.nBoxPort;
+        return blThis || blOther;
     }
     bool IsDue(int64_t nNow) const { return blBefore || (nLease != 0 && nNow - nAsked >= nLease / 2); }
     // Boot time at which the router has ended it by itself; -1: never, or nobody knows.

@@ -465,6 +465,47 @@ TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
     }
 }
 
+// A router that says yes to the removal, keeps the entry for the former address, and refuses the new one for its sake:
+// whatever comes in between, the entry is known, and named when its rule has gone.
+TEST(Mapping, WhatIsKeptForAFormerAddressStaysOnRecord) {
+    class Guarding : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            mSzAtAsking = mRecord.Text();
+            const auto it = mMapTable.find(tavo::KeyOf(mapping));
+            const bool blTaken = it != mMapTable.end() && it->second.szClient != mapping.szClient;
+            return blTaken ? (mBlLies ? RouterReply{} : IgdReply(718)) : MemoryRouter::Add(mapping);
+        }
+        explicit Guarding(const tavo::Record& record) : mRecord(record) {}
+        bool mBlLies = false;  // about this, too
+        const tavo::Record& mRecord;
+        std::string mSzAtAsking;
+    };
+    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
+    for (const std::string szCase : {"refused", "full disk", "yes to all", "killed"}) {
+        SCOPED_TRACE(szCase);
+        Core core;
+        Guarding router(core.record);
+        router.mSzRewritten = "upnp";
+        core.Run(router, rgWanted);
+        core.szBox = "192.168.1.6";
+        router.mBlKeepsRemoved = true;
+        router.mBlLies = szCase == "yes to all";
+        core.blDiskFull = szCase == "full disk";
+        for (int i = 0; i < 2; ++i) {
+            EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{core.blDiskFull ? "1/tcp unrecorded" : "1/tcp kept"});
+            EXPECT_EQ(core.record.Here().at({"TCP", 1}).szClient, kBox);
+        }
+        if (szCase == "killed") {  // before the answer to the asking
+            core.record = tavo::Record(router.mSzAtAsking, "boot");
+        }
+        EXPECT_EQ(Texts(core.Run(router, {})), Rows{"1/tcp kept left over"});
+        router.mBlKeepsRemoved = false;
+        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+        EXPECT_TRUE(core.record.Here().empty());
+    }
+}
+
 TEST(Mapping, AFormerAddressIsTakenAwayFirstOrWaitedFor) {
     for (const bool blRefuses : {false, true}) {
         MemoryRouter router;
