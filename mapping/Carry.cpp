@@ -117,9 +117,6 @@ void Carrier::CheckGone() {
         return pPlace->pWanted != nullptr;
     });
     if (mPlaces.what.blShows) {
-        if (IsOver()) {
-            return;
-        }
         mPlaces.LookForGone(rgpGone);
     }
     for (Place* pPlace : rgpGone) {

@@ -109,10 +109,12 @@ void Places::Show(const RouterMapping& entry, Place& place) {
     place.enSeen = Seen::kPresent;
     place.entry = entry;
     Made* pMade = KeyOf(entry) == place.key ? MadeAt(place) : nullptr;
-    // Whom it is for where the router does not show that: for whom we made it, unless its text is somebody else's.
+    // Whom it is for where the router does not show that: for whom we made it, unless its text is somebody else's. What
+    // was there before and may be there still is looked for first, but where the router has just said yes to the new.
     if (pMade != nullptr && entry.szClient.empty() &&
         (entry.szDescription.empty() || entry.szDescription.starts_with(kOwnPrefix))) {
-        place.entry.szClient = pMade->szClient;
+        const bool blBefore = !place.blWritten && !pMade->blShown && pMade->other.nBoxPort == entry.nBoxPort;
+        place.entry.szClient = blBefore ? pMade->other.szClient : pMade->szClient;
     }
     if (pMade == nullptr || !pMade->IsEntry(place.entry)) {
         return;
@@ -190,13 +192,13 @@ bool Places::IsListedWithout(const PlaceList& rgpPlaces) {
 }
 
 void Places::LookForGone(const PlaceList& rgpPlaces) {
+    for (Place* pPlace : rgpPlaces) {
+        pPlace->enSeen = Seen::kUnknown;
+    }
     if (rgpPlaces.empty() || guard.IsOver()) {
         return;
     }
     const bool blForm = what.blForm;  // one look reads the list for all
-    for (Place* pPlace : rgpPlaces) {
-        pPlace->enSeen = Seen::kUnknown;
-    }
     const auto fnAbsent = [](Place& place) { place.enSeen = Seen::kAbsent; };
     if (!blForm) {
         LookAtRanges(rgpPlaces, fnAbsent);

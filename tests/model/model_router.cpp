@@ -54,6 +54,36 @@ tavo::RouterMapping Router::Shown(const Entry& entry) const {
     return shown;
 }
 
+std::string Habits::Text() const {
+    const std::pair<bool, const char*> rgHas[] = {
+        {blPermanentOnly, "permanent only"},
+        {blForgetsLease, "forgets leases"},
+        {blListsWhatIsLeft, "lists what is left"},
+        {nLongestLease != 0, "short leases"},
+        {nText == 1, "rewrites texts"},
+        {nText == 2, "drops texts"},
+        {blSecure, "secure"},
+        {!blOverwrites, "718 for a change"},
+        {nCapacity < 1000, blSaysFull ? "small" : "small and does not say so"},
+        {enList != tavo::Reply::kOk, "lists badly"},
+        {blRanges, "ranges"},
+        {blSaysChanged, "says changed"},
+        {blBlind, "blind"},
+        {blKeepsRemoved, "keeps removed"},
+        {blSlowToHide, "slow to hide"},
+        {blSlowToShow, "slow to show"},
+        {blForm, "form"},
+        {blApply, "to be applied"},
+        {blMute, "mute"},
+        {blHidesClient, "hides clients"},
+    };
+    std::string szText;
+    for (const auto& [blHas, szHabit] : rgHas) {
+        szText += blHas ? std::string(szText.empty() ? "" : ", ") + szHabit : "";
+    }
+    return szText;
+}
+
 std::map<tavo::MappingKey, tavo::RouterMapping> Router::View() const {
     std::map<tavo::MappingKey, tavo::RouterMapping> mapView;
     for (const auto& [key, entry] : mMapTable) {

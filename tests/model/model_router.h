@@ -46,6 +46,8 @@ struct Habits {
     bool blApply = false;        // of a form: what was done is lost unless it is applied
     bool blMute = false;         // of a form: it shows no list
     bool blHidesClient = false;  // of a form: the list does not show whom an entry is for
+
+    std::string Text() const;  // those that it has
 };
 
 class Router : public tavo::Router {

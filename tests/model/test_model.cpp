@@ -329,7 +329,8 @@ private:
     void Broken(const std::string& szPromise, const MappingKey& key) {
         if (mSzBroken.empty()) {
             const model::Router::Entry* pEntry = mRouter.At(key);
-            mSzBroken = szPromise + ": " + key.first + " " + std::to_string(key.second) + "\n    box " + mRouter.szBox +
+            mSzBroken = szPromise + ": " + key.first + " " + std::to_string(key.second) +
+                        "\n    router: " + mRouter.habits.Text() + "\n    box " + mRouter.szBox +
                         (pEntry == nullptr
                              ? ", nothing there"
                              : ", there " + pEntry->mapping.szClient + ":" + std::to_string(pEntry->mapping.nBoxPort) +

@@ -120,10 +120,10 @@ struct Core {
     tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted,
                          const std::string& szHardware = "") {
         record.TurnTo({"192.168.1.1", szHardware});
-        return tavo::BringInLine(
-            router, rgWanted, record, habit,
-            {szBox, [this] { return nNow; }, [] { return false; }, [this] { return ++nSaves > 0 && !blDiskFull; },
-             [this](const RouterMapping&, const tavo::Step&) { ++nTold; }});
+        return tavo::BringInLine(router, rgWanted, record, habit,
+                                 {szBox, [this] { return nNow; }, [this] { return nStopIn > 0 && --nStopIn == 0; },
+                                  [this] { return ++nSaves > 0 && !blDiskFull; },
+                                  [this](const RouterMapping&, const tavo::Step&) { ++nTold; }});
     }
     std::string szBox = kBox;
     tavo::Record record{"", "boot"};
@@ -131,6 +131,7 @@ struct Core {
     int64_t nNow = 1000;
     int nSaves = 0;
     int nTold = 0;
+    int nStopIn = 0;  // looks at the stop until there is one; 0: there is none
     bool blDiskFull = false;
 };
 
@@ -247,7 +248,9 @@ public:
     RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
         const auto it = mMapInTheWay.find({szProtocol, nPort});
         if (mMapTable.contains({szProtocol, nPort}) || it == mMapInTheWay.end()) {
-            return MemoryRouter::Get(szProtocol, nPort, mapping);
+            RouterReply reply = MemoryRouter::Get(szProtocol, nPort, mapping);
+            mapping.szClient = mBlHidesClient ? "" : mapping.szClient;
+            return reply;
         }
         mapping = it->second;
         return {};
@@ -268,6 +271,13 @@ public:
                    ? RouterReply{tavo::Reply::kNoSuchEntry, "no such rule"}
                    : MemoryRouter::Remove(mapping);
     }
+    RouterReply List(std::vector<RouterMapping>& rgMappings) override {
+        RouterReply reply = MemoryRouter::List(rgMappings);
+        for (RouterMapping& mapping : rgMappings) {
+            mapping.szClient = mBlHidesClient ? "" : mapping.szClient;
+        }
+        return reply;
+    }
     RouterReply Apply() override {
         ++mNApplied;
         if (!mBlApplies && mMapBefore) {
@@ -284,6 +294,7 @@ public:
 
     std::map<tavo::MappingKey, RouterMapping> mMapInTheWay;
     bool mBlShows = true;
+    bool mBlHidesClient = false;
     bool mBlApplies = true;
     std::optional<std::map<tavo::MappingKey, RouterMapping>> mMapBefore;  // what is there if that is not applied
     uint16_t mNTornAway = 0;                                              // goes with any other one
@@ -363,6 +374,21 @@ TEST(Mapping, AFormHasDoneNothingUntilItIsApplied) {
     }
 }
 
+// And the list does not show whom an entry is for: the one for the former address is not taken for the new one.
+TEST(Mapping, AFormThatHidesClientsIsFilledInAnewForANewAddress) {
+    FormRouter router;
+    router.mBlHidesClient = true;
+    Core core;
+    core.habit.nLease = 0;
+    core.Run(router, {Entry(2, 2, "", "tavo:b")});
+    core.szBox = "192.168.1.6";
+    router.mBlApplies = false;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})).front(), "2/tcp not applied");
+    router.mBlApplies = true;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), Rows{"2/tcp 1 anew"});
+    EXPECT_EQ((router.mMapTable[{"TCP", 2}].szClient), core.szBox);
+}
+
 // A list without names, or without addresses: ours is what the record knows, and what looks like it no more.
 TEST(Mapping, WhatAListLeavesOutTheRecordKnows) {
     struct Case {
@@ -417,6 +443,13 @@ TEST(Mapping, AYesToARemovalIsLookedAt) {
             EXPECT_TRUE((core.record.Here().contains({"TCP", 1})));
             EXPECT_EQ(core.nTold, 0) << "nothing has changed";
         }
+        for (core.nStopIn = 1; core.nStopIn < 8; ++core.nStopIn) {
+            const int nStopIn = core.nStopIn;
+            core.Run(router, {});
+            EXPECT_TRUE((core.record.Here().contains({"TCP", 1}))) << "stopped at look " << nStopIn;
+            core.nStopIn = nStopIn;
+        }
+        core.nStopIn = 0;
         router.mMapTable.erase({"TCP", 1});
         EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
         EXPECT_FALSE((core.record.Here().contains({"TCP", 1})));
