@@ -36,10 +36,6 @@ std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vec
         return mRgRefusals;
     }
     RefuseAll(rgWanted, login);
-    for (const Outcome& left :
-         LeftOnRecord(record, MappingsOf(rgWanted), mRouter.What(), ReplyOf(login), BootSeconds())) {
-        Refuse(left, {}, RefusalKind::kRemoval);
-    }
     return mRgRefusals;
 }
 
@@ -83,6 +79,10 @@ void Forwarder::RefuseAll(const std::vector<Job>& rgWanted, const StepResult& re
         const bool blMade = it != rows.end() && it->second.nBoxPort == job.mapping.nBoxPort;
         mRgRefusals.push_back({MappingName(job.mapping), result.szWhy, job, RefusalKind::kForward,
                                result.enEnd == WebEnd::kAnswered && !blMade});
+    }
+    for (const Outcome& left :
+         LeftOnRecord(mMade.Get(), MappingsOf(rgWanted), mRouter.What(), ReplyOf(result), BootSeconds())) {
+        Refuse(left, {}, RefusalKind::kRemoval);
     }
 }
 

@@ -160,6 +160,14 @@ class Manual(unittest.TestCase):
         os.unlink(EVENTS)
         self.saved({})
 
+    def test_what_cannot_be_taken_away_for_want_of_the_list_is_named(self):
+        LAB.start_web("form")
+        self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+        path = "/etc.defaults/portforward/routerdb/Alderman/Homestead 2/1.0/router.ops"
+        LAB.write(path, LAB.read(path).replace("<h1>Port forwarding</h1>", "another title"))
+        LAB.save()
+        self.assertEqual([row["name"] for row in self.rows()[1]["left_over"]], ["5001/tcp"])
+
     def test_a_router_that_falls_silent_is_left_alone(self):
         LAB.start_web("form", "hangs_on_add")
         LAB.save(*(f"{port},1,tcp,{port},{port}" for port in range(5001, 5021)), seconds=25)
