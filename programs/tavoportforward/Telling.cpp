@@ -98,10 +98,10 @@ OutcomeList Outcomes(const RunResult& result) {
     return rgOutcomes;
 }
 
-void PublishRun(const RunResult& result) {
+Published StateOf(const RunResult& result) {
     Published state{.szDaemon = kName, .szProtocol = kProtocol};
     state.nAt = std::time(nullptr);
-    state.blSwitchedOn = true;
+    state.blSwitchedOn = result.blInUse;
     state.blRulesReadable = result.blRulesReadable;
     state.szGateway = result.szGateway;
     state.szBox = result.szBox;
@@ -112,14 +112,18 @@ void PublishRun(const RunResult& result) {
     for (Outcome& outcome : state.rgOutcomes) {
         outcome.nSince = state.nAt;
     }
-    Publish(state);
+    return state;
 }
 
 }  // namespace
 
 void Tell(const RunResult& result) {
     Log(result.rgRefusals);
-    PublishRun(result);
+    Publish(StateOf(result));
+}
+
+std::string TextOf(const RunResult& result) {
+    return ToJson(StateOf(result));
 }
 
 void TellNotTried(RunResult result, const std::string& szWhy) {
@@ -142,7 +146,7 @@ void TellNotTried(RunResult result, const std::string& szWhy) {
             result.rgRefusals.push_back({MappingName(job.mapping), szWhy, job, RefusalKind::kForward, false});
         }
     }
-    PublishRun(result);
+    Publish(StateOf(result));
 }
 
 }  // namespace tavo

@@ -19,9 +19,12 @@ struct RunResult {
     bool blRulesReadable = true;
     std::vector<Job> rgWanted = {};  // what the router was asked for
     std::vector<Refusal> rgRefusals = {};
+    bool blInUse = true;  // else the pages were to take away all that they forward, whatever the rules ask for
 };
 
 void Tell(const RunResult& result);
+// What would be published of it.
+std::string TextOf(const RunResult& result);
 // The same for a run that could not try anything: of each rule nobody knows what the router does.
 void TellNotTried(RunResult result, const std::string& szWhy);
 

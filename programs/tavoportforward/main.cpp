@@ -15,10 +15,13 @@
 #include <exception>
 #include <memory>
 
+#include "ground/BootClock.h"
 #include "ground/ConfList.h"
 #include "ground/FileLock.h"
 #include "ground/RouterScript.h"
 #include "ground/TextFile.h"
+#include "ground/net/Neighbour.h"
+#include "mapping/Carry.h"
 #include "programs/tavoportforward/Description.h"
 #include "programs/tavoportforward/EarlierRecord.h"
 #include "programs/tavoportforward/Forwarder.h"
@@ -32,13 +35,16 @@ using tavo::Refusal;
 using tavo::Value;
 
 constexpr char kHelp[] =
-    "Usage: tavoportforward [--version | --check FILE... | --help]\n"
+    "Usage: tavoportforward [--take-away | --left | --version | --check FILE... | --help]\n"
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
     "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
     "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
     "for: /var/lib/tavo/pages_made.conf remembers it, and is the only memory of a router that shows no list.\n"
     "What became of each port stands in /run/tavo/tavoportforward.json.\n"
     "\n"
+    "  --take-away takes away all that it made, also when UPnP or NAT-PMP drives the router by now: with the\n"
+    "              account that /etc/portforward/router_account.conf keeps since\n"
+    "  --left      says, as that file does, what the record has; asks no router\n"
     "  --version   the version of the operations syntax that this tool understands\n"
     "  --check     says of router.ops and router.des (by that ending) files what is wrong with them\n"
     "  --help      this text\n"
@@ -46,6 +52,8 @@ constexpr char kHelp[] =
     "Exit status: 0 all is in place (or good); 1 some forwards are not (see the system log\n"
     "and /var/log/tavo/event.log), or a checked file is bad; 2 unknown argument; 3 nothing could be tried.\n";
 constexpr char kMadeFile[] = "/var/lib/tavo/pages_made.conf";
+// The settings of the pages while UPnP or NAT-PMP drives the router.
+constexpr char kAside[] = "/etc/portforward/router_account.conf";
 constexpr char kLock[] = "/var/run/tavoportforward.lock";
 constexpr auto kRunLimit = std::chrono::seconds(180);  // well below the five minutes that a save waits
 constexpr int kAddressSize = 64;
@@ -132,18 +140,30 @@ bool LoadOperations(KnownRouter& router, const TAVO_PF_CONF* pSection, std::stri
     return true;
 }
 
-bool Load(KnownRouter& router, std::string& szWhy) {
+const TAVO_PF_CONF* SectionOf(const TAVO_PF_CONF* pSection, const std::string& szGateway) {
+    while (pSection != nullptr && szGateway != pSection->szSection) {
+        pSection = pSection->pNext;
+    }
+    return pSection;
+}
+
+// blAside: where the settings are not those of the pages, what was put aside will do.
+bool Load(KnownRouter& router, bool blAside, std::string& szWhy) {
     if (!FindAddresses(router, szWhy)) {
         return false;
     }
-    const ConfList pRouters(TAVOPFGwRouterConfGet());
-    for (const TAVO_PF_CONF* pSection = pRouters.get(); pSection != nullptr; pSection = pSection->pNext) {
-        if (router.szGateway == pSection->szSection) {
-            return LoadOperations(router, pSection, szWhy) && ReadSettings(router, pSection, szWhy);
-        }
+    ConfList pRouters(TAVOPFGwRouterConfGet());
+    const TAVO_PF_CONF* pSection = SectionOf(pRouters.get(), router.szGateway);
+    if (blAside && (pSection == nullptr || Value(pSection, "conn_type").empty())) {
+        pRouters = tavo::LoadConfList(kAside);
+        pSection = SectionOf(pRouters.get(), router.szGateway);
     }
-    szWhy = "there are no settings for the router " + router.szGateway;
-    return false;
+    if (pSection == nullptr) {
+        szWhy = "there are no settings for the " + std::string(blAside ? "pages of the router " : "router ") +
+                router.szGateway;
+        return false;
+    }
+    return LoadOperations(router, pSection, szWhy) && ReadSettings(router, pSection, szWhy);
 }
 
 tavo::RouterState StateAfter(tavo::WebEnd enTrouble) {
@@ -165,20 +185,7 @@ std::string RouterWhy(const std::vector<Refusal>& rgRefusals) {
     return itRun == rgRefusals.end() ? "" : itRun->szWhy;
 }
 
-int Run() {
-    const tavo::FileLock lock(kLock);
-    if (!lock.Wait([] { return true; })) {  // whoever holds it is bounded
-        return NotTried("the lock " + std::string(kLock) + " cannot be taken");
-    }
-    KnownRouter router;
-    std::string szWhy;
-    if (!Load(router, szWhy)) {
-        return NotTried(szWhy, router);
-    }
-    tavo::JobSet jobs = tavo::ReadJobs(router.pDescription.get());
-    if (!jobs.blReadable) {
-        return NotTried("the rules cannot be read", router);
-    }
+int Bring(const KnownRouter& router, tavo::MadeFile& made, tavo::JobSet jobs, bool blInUse) {
     tavo::WebClient client(router.web, std::chrono::steady_clock::now() + kRunLimit);
     tavo::Session session(client, router.operations,
                           {{"user", router.web.szUser},
@@ -186,9 +193,7 @@ int Run() {
                            {"gateway", router.szGateway},
                            {"url", router.web.Url()},
                            {"box", router.szBox}});
-    tavo::MadeFile made(kMadeFile);
-    tavo::TakeOverEarlierRecord(made);
-    tavo::RunResult result{router.szGateway, router.szBox};
+    tavo::RunResult result{.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = blInUse};
     tavo::Forwarder forwarder(session, router.operations, made, router.szBox);
     result.rgRefusals = forwarder.Run(router.szGateway, jobs.rgJobs);
     result.enRouter = StateAfter(session.LastTrouble());
@@ -197,6 +202,74 @@ int Run() {
     result.rgWanted = std::move(jobs.rgJobs);
     tavo::Tell(result);
     return result.rgRefusals.empty() ? kAllInPlace : kSomeMissing;
+}
+
+int Run() {
+    KnownRouter router;
+    std::string szWhy;
+    if (!Load(router, false, szWhy)) {
+        return NotTried(szWhy, router);
+    }
+    tavo::JobSet jobs = tavo::ReadJobs(router.pDescription.get());
+    if (!jobs.blReadable) {
+        return NotTried("the rules cannot be read", router);
+    }
+    tavo::MadeFile made(kMadeFile);
+    tavo::TakeOverEarlierRecord(made);
+    return Bring(router, made, std::move(jobs), true);
+}
+
+// What the router in front has by the record, each with that reason for being there still.
+tavo::RunResult LeftBy(tavo::Record& record, const KnownRouter& router, const std::string& szWhy) {
+    tavo::RunResult result{.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = false};
+    record.TurnTo({router.szGateway, tavo::HardwareAddress(router.szGateway)});
+    for (const tavo::Outcome& left : tavo::LeftOnRecord(record, {}, {}, {}, tavo::BootSeconds())) {
+        result.rgRefusals.push_back({left.szName, szWhy, {}, tavo::RefusalKind::kRemoval, false});
+    }
+    return result;
+}
+
+// The rules are carried out in another way by now, or by nobody: none of them counts here.
+int TakeAway() {
+    KnownRouter router;
+    std::string szWhy;
+    const bool blKnown = Load(router, true, szWhy);
+    tavo::MadeFile made(kMadeFile);
+    tavo::TakeOverEarlierRecord(made);
+    const tavo::RunResult left = LeftBy(made.Get(), router, szWhy);
+    if (blKnown && !left.rgRefusals.empty()) {
+        return Bring(router, made, {}, false);
+    }
+    tavo::Tell(left);
+    return left.rgRefusals.empty() && !router.blNoGateway ? kAllInPlace : kNotTried;
+}
+
+int ShowLeft() {
+    KnownRouter router;
+    std::string szWhy;
+    const bool blKnown = Load(router, true, szWhy);
+    szWhy = blKnown
+                ? "the router's own pages forward it; the next 'sudo tavoportmap save', or 'off', has them take it away"
+                : "the router's own pages forward it: take it away there (" + szWhy + ")";
+    tavo::Record record = tavo::MadeFile(kMadeFile).Get();
+    tavo::RunResult left = LeftBy(record, router, szWhy);
+    const size_t nHere = record.Here().size();
+    record.TurnTo({router.szGateway, ""});
+    if (record.Here().size() > nHere) {
+        left.szRouterWhy =
+            "by the record, the pages of another router that was at this address forward ports to this box; they count "
+            "again should it be back";
+    }
+    std::fputs(tavo::TextOf(left).c_str(), stdout);
+    return kAllInPlace;
+}
+
+int Locked(int (*fnRun)()) {
+    const tavo::FileLock lock(kLock);
+    if (!lock.Wait([] { return true; })) {  // whoever holds it is bounded
+        return NotTried("the lock " + std::string(kLock) + " cannot be taken");
+    }
+    return fnRun();
 }
 
 int Check(char** pszPaths) {
@@ -218,7 +291,10 @@ int Check(char** pszPaths) {
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (argc > 1) {
+    const std::string_view szOption = argc == 2 ? argv[1] : "";
+    const bool blTakeAway = szOption == "--take-away";
+    const bool blLeft = szOption == "--left";
+    if (argc > 1 && !blTakeAway && !blLeft) {
         if (std::strcmp(argv[1], "--version") == 0) {
             std::printf("syntax version=%d\n", tavo::kSyntaxVersion);
             return kAllInPlace;
@@ -238,7 +314,7 @@ int main(int argc, char** argv) {
     signal(SIGPIPE, SIG_IGN);
     openlog("tavoportforward", LOG_PID, LOG_DAEMON);
     try {
-        return Run();
+        return blLeft ? ShowLeft() : Locked(blTakeAway ? TakeAway : Run);
     } catch (const std::exception& error) {
         return NotTried(error.what());
     }
