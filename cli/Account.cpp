@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <memory>
+#include <utility>
 
 #include "tavo/core.h"
 
@@ -28,6 +29,12 @@ constexpr Field kAccount[kFields] = {{"user", &RouterConfReader::GetUser, &Conf:
                                      {"conn_type", &RouterConfReader::GetConnType, &Conf::szConnType},
                                      {"conn_port", &RouterConfReader::GetConnPort, &Conf::szConnPort}};
 
+// Which router's they are: by these its description is found while they are not in use.
+constexpr std::pair<const char*, int (RouterConfReader::*)(std::string&)> kIdentity[] = {
+    {"brand", &RouterConfReader::GetBrand},
+    {"model", &RouterConfReader::GetModel},
+    {"version", &RouterConfReader::GetVersion}};
+
 }  // namespace
 
 bool KeepAccount(const std::string& szGateway) {
@@ -46,6 +53,11 @@ bool KeepAccount(const std::string& szGateway) {
     }
     if (!blAny) {
         return true;  // what was put aside before still counts
+    }
+    for (const auto& [szKey, fnGet] : kIdentity) {
+        std::string szValue;
+        (reader.*fnGet)(szValue);
+        TLIBCSzHashSetValue(pHash.get(), szKey, szValue.c_str());
     }
     DropAccount();
     return TLIBCFileAddSection(kFile, szGateway.c_str(), pHash.get(), 0) == 1;

@@ -229,7 +229,7 @@ std::optional<Outcome> JudgeSurroundings(const Situation& situation) {
                    : std::optional(
                          Outcome{Standing::kUntold, fmt::format("whether the router's own pages still have the rules "
                                                                 "is not known: they were not written since this box "
-                                                                "was started; {}",
+                                                                "was started, or since they are in use again; {}",
                                                                 kSave)});
     }
     if (pKeeper == nullptr) {
@@ -333,6 +333,9 @@ std::vector<std::string> WarningsOf(const Situation& situation) {
     }
     if (!situation.szNotAsked.empty()) {
         rgszWarnings.push_back(situation.szNotAsked);
+    }
+    if (situation.pagesLeft && !situation.pagesLeft->szRouterWhy.empty()) {
+        rgszWarnings.push_back(Clean(situation.pagesLeft->szRouterWhy));
     }
     const Published* pWord = situation.Word();
     if (pWord != nullptr && !pWord->blRulesReadable) {

@@ -163,13 +163,14 @@ bool IsProgram(pid_t nPid, const std::string& szProgram) {
 
 std::optional<Published> ReadPublished(const std::string& szProgram) {
     const auto szText = ReadRootsFile(szProgram + ".json");
-    const auto js = szText ? ReadJson(*szText) : std::nullopt;
-    if (!js || !js->isObject()) {
-        return std::nullopt;
-    }
-    Published published = FromJson(*js);
-    const bool blAlive = szProgram == kPagesProgram || IsProgram(published.nPid, szProgram);
-    return blAlive ? std::optional(std::move(published)) : std::nullopt;
+    auto published = szText ? PublishedIn(*szText) : std::nullopt;
+    const bool blAlive = published && (szProgram == kPagesProgram || IsProgram(published->nPid, szProgram));
+    return blAlive ? std::move(published) : std::nullopt;
+}
+
+std::optional<Published> PublishedIn(const std::string& szText) {
+    const auto js = ReadJson(szText);
+    return js && js->isObject() ? std::optional(FromJson(*js)) : std::nullopt;
 }
 
 std::string WhoHas(const std::optional<PublishedHolder>& holder) {

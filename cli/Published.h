@@ -65,6 +65,8 @@ struct Published {
 // What szProgram ("upnpd", "natpmpd", "tavoportforward") has published. tavoportforward need not run any more: a
 // router's own pages are written once.
 std::optional<Published> ReadPublished(const std::string& szProgram);
+// The same of a text that such a program has said.
+std::optional<Published> PublishedIn(const std::string& szText);
 
 const char* ToWord(PortState enState);
 // " (192.168.1.7, console)", cleaned; empty where it is not known.

@@ -15,6 +15,7 @@
 #include "KeysGuard.h"
 #include "OnSignal.h"
 #include "Outcome.h"
+#include "Pages.h"
 #include "Progress.h"
 #include "StoredRouter.h"
 #include "tavo/portforward.h"
@@ -24,6 +25,7 @@ namespace tavo::cli {
 
 namespace {
 
+constexpr int kPagesCleared = 10;
 constexpr int kRulesWritten = 80;  // percent, once the rule file is written
 constexpr auto kPoll = std::chrono::milliseconds(50);
 constexpr auto kHandOver = std::chrono::seconds(5);
@@ -223,11 +225,17 @@ int GoOn(bool blJson, Progress& progress) {
                  blJson);
 }
 
-// The library's call, and for rules that leave none the wait that it leaves out.
-int CallLibrary(const std::string& szGateway, std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, bool blJson,
-                SaveResult& result) {
+// The library's call, and for rules that leave none the wait that it leaves out. What pages forward that are not in use
+// goes before: the other way would find its ports taken.
+int CallLibrary(const StoredRouter& router, const std::string& szGateway,
+                std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, bool blJson, SaveResult& result,
+                std::vector<PublishedLeftOver>& rgLeft) {
     Progress progress(blJson);
     const OnSignal signals([&] { return GoOn(blJson, progress); });
+    if (router.enWay != Way::kManual && HavePagesMade()) {
+        progress.Show(kPagesCleared, "having the router's own pages take away what they forward");
+        rgLeft = TakeAwayByPages();
+    }
     const int nResult = TLibSaveRules(
         szGateway.c_str(), static_cast<int>(rgRecords.size()), rgRecords.data(), false, &result,
         [](const SaveResult* pResult, void* pData) {
@@ -241,13 +249,14 @@ int CallLibrary(const std::string& szGateway, std::vector<__tag_TAVO_ROUTER_RULE
 }
 
 Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, const Rules& rules,
-                  std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, SaveResult& result, bool blJson) {
+                  std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, SaveResult& result, bool blJson,
+                  std::vector<PublishedLeftOver>& rgLeft) {
     KeysGuard keys;
     if (keys.Obstacle()) {
         return *keys.Obstacle();
     }
     const time_t nStart = std::time(nullptr);
-    const int nResult = CallLibrary(szGateway, rgRecords, blJson, result);
+    const int nResult = CallLibrary(router, szGateway, rgRecords, blJson, result, rgLeft);
     if (nResult == 0) {
         keys.Keep();
     }
@@ -301,10 +310,12 @@ Reply SaveRules(const Rules& rules, bool blJson) {
     SaveResult result = {};
     const StoredRouter router = ReadStoredRouter();
     const auto refused = Refused(router, *szGateway, rules, result);
-    Reply reply = refused ? *refused : SaveRecords(router, *szGateway, rules, *rgRecords, result, blJson);
+    std::vector<PublishedLeftOver> rgLeft;
+    Reply reply = refused ? *refused : SaveRecords(router, *szGateway, rules, *rgRecords, result, blJson, rgLeft);
     if (reply.enExit == kOk && !AreStored(rules)) {
         reply.rgszWarnings.emplace_back(kChanged);
     }
+    AddLeftByPages(rgLeft, rules, reply);
     reply.jsAnswer["status"] = result.nStatus;
     reply.jsAnswer["rules"] = static_cast<Json::UInt>(rules.size());
     return reply;

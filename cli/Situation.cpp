@@ -11,6 +11,7 @@
 #include <ctime>
 #include <memory>
 
+#include "Pages.h"
 #include "tavo/core.h"
 #include "tavo/net.h"
 
@@ -121,6 +122,9 @@ std::vector<PublishedLeftOver> Situation::LeftOver() const {
             rgLeftOver.insert(rgLeftOver.end(), rgMore.begin(), rgMore.end());
         }
     }
+    if (pagesLeft) {
+        rgLeftOver.insert(rgLeftOver.end(), pagesLeft->rgLeftOver.begin(), pagesLeft->rgLeftOver.end());
+    }
     return rgLeftOver;
 }
 
@@ -174,6 +178,12 @@ Situation LookAround(bool blLive) {
     LookAt(situation.upnpd, "runupnpportmapping", UpnpDaemon().IsAlive());
     LookAt(situation.natpmpd, "runnatpmpportmapping", NatpmpDaemon().IsAlive());
     situation.pages = ReadPublished("tavoportforward");
+    if (situation.pages && !situation.pages->blSwitchedOn) {
+        situation.pages.reset();
+    }
+    if (!situation.IsByPages()) {
+        situation.pagesLeft = LeftByPages();
+    }
     situation.rules = ReadStoredRules();
     situation.running = WhatRuns();
     if (blLive) {

@@ -55,7 +55,8 @@ struct Situation {
     std::optional<DetectResult> detected;  // the last detection
     Daemon upnpd{"upnpd", "UPnP"};
     Daemon natpmpd{"natpmpd", "NAT-PMP"};
-    std::optional<Published> pages;  // what tavoportforward came to
+    std::optional<Published> pages;      // what tavoportforward came to, when it last wrote the rules
+    std::optional<Published> pagesLeft;  // what the router's pages still forward although they are not in use
     StoredRules rules;
     Running running;
     bool blAsked = false;    // --live: the router was asked
@@ -68,7 +69,7 @@ struct Situation {
     // What is known of the mappings: the keeper's word, or that of the pages.
     const Published* Word() const;
     // What no rule asks for and the router still has: by that word, and by that of a daemon that is switched off and
-    // has not been able to take away what it made.
+    // has not been able to take away what it made; and what its pages forward that are not in use.
     std::vector<PublishedLeftOver> LeftOver() const;
     // The router's address on its other side; empty where nobody has said it.
     std::string Outside() const { return Word() == nullptr ? "" : Word()->szOutside; }

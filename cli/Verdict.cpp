@@ -5,6 +5,7 @@
 #include <fmt/format.h>
 
 #include "Account.h"
+#include "Pages.h"
 
 namespace tavo::cli {
 
@@ -171,8 +172,15 @@ Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, i
             return Failure("the settings are stored, but " + *szFault);
         }
     }
-    return {.szMessage = fmt::format(
-                "stored as the settings of the router {}; 'tavoportmap save' writes the rules to it", szGateway)};
+    Reply reply{.szMessage = fmt::format(
+                    "stored as the settings of the router {}; 'tavoportmap save' writes the rules to it", szGateway)};
+    const auto left = blDaemon ? LeftByPages() : std::nullopt;
+    if (left && !left->rgLeftOver.empty()) {
+        reply.rgszWarnings.push_back(
+            fmt::format("until then the router's own pages go on forwarding {}; the save has them take it away first",
+                        NamesOf(left->rgLeftOver)));
+    }
+    return reply;
 }
 
 }  // namespace tavo::cli

@@ -1124,6 +1124,38 @@ class Tool(unittest.TestCase):
         self.expect("status --live", OK, "warning: what stands in a router's own pages is not read back")
         self.expect("router table", FAILED, "its table stands there, mostly at http://192.168.77.1/")
 
+    def test_what_pages_forward_that_are_not_in_use_is_named(self):
+        """By the program that keeps the record; where it knows no account any more it asks nobody."""
+        program, record = "/usr/tavo/bin/tavoportforward", "/var/lib/tavo/pages_made.conf"
+        row = '[{0} {2} {3}]\ngateway="{0}"\nhardware="{1}"\nprotocol="{2}"\nrouter_port="{3}"\nbox_port="{3}"\nmore="{4}"\nclient="192.168.77.2"\ntext="tavo:x"\nshown="no"\n'
+        os.makedirs("/usr/tavo/bin", exist_ok=True)
+        with contextlib.suppress(FileNotFoundError):
+            os.unlink(program)
+        os.symlink(f"{BUILD}/programs/tavoportforward", program)
+        self.addCleanup(lambda: [os.path.lexists(path) and os.unlink(path) for path in (program, record, "/run/tavo/tavoportforward.json")])
+        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        why = "own pages forward it: take it away there \\(there are no settings for the pages of the router 192.168.77.1\\)"
+        for text, names in ((row.format(GATEWAY, "", "TCP", 443, 0) + row.format(GATEWAY, "", "BOTH", 7000, 4), ["7000-7004/both", "443/tcp"]),
+                            (row.format("10.9.9.9", "", "TCP", 443, 0), []), ("", []), ("no record\n", [])):
+            for on, settings, said in (("upnp", KNOWN % ("yes", "no"), names), ("natpmp", KNOWN % ("no", "yes"), names),
+                                       ("none", KNOWN % ("no", "no"), []), ("none", "", names)):
+                self.keep(on, alive=False)
+                put(record, text)
+                put(ROUTER, settings)
+                self.publish(1, name="tavoportforward", protocol="pages", left_over=[])
+                self.assertEqual([left["name"] for left in self.json("status")[1]["left_over"]], said)
+                if said:
+                    self.assertRegex(tool("status")[1], f"443/tcp +192.168.77.2 +.*{why}")
+                    self.assertEqual(get(record), text, "to look changes nothing")
+            for command, done in (("close web", "443/tcp closed"), ("off", "every port is closed")):
+                self.keep(alive=False)
+                put(record, text)
+                code, told = self.json(*command.split(), **WRITES)
+                self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (REFUSED if names else OK, names), told)
+                self.assertEqual(done in told["message"], not names, told)
+                self.assertEqual("pages, which are not in use any more, still forward 7000-7004/both, 443/tcp" in told["message"], bool(names))
+        self.assertEqual(self.in_force()[0]["enabled"], False)
+
     def test_status_takes_nobodys_word_but_roots(self):
         path = "/run/tavo/upnpd.json"
         pid = self.keep()

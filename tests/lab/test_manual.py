@@ -1,11 +1,12 @@
 """Routers that have web pages only: rules saved on the box, a stranger outside, and pages with faults."""
 import json
 import os
+import re
 import signal
 import time
 import unittest
 
-from homelab import BOX, GATEWAY, HERE, LAN2, run_tests, wait_for
+from homelab import BOX, BUILD, GATEWAY, HERE, LAN2, run_tests, wait_for
 
 LAB = None
 TOOL = "/usr/tavo/bin/tavoportforward"
@@ -213,6 +214,68 @@ class Manual(unittest.TestCase):
         tool.send_signal(signal.SIGKILL)
         tool.wait()
         self.saved({})
+
+    def test_what_the_pages_forward_goes_when_they_are_not_in_use_any_more(self):
+        account = "/etc/portforward/router_account.conf"
+        pages = "router set --brand Cobbler --model Gate --version 7.3 --upnp no"
+
+        def told(code, arguments):
+            run = LAB.run("box", f"{BUILD}/cli/tavoportmap --json {arguments}", check=False)
+            self.assertEqual(run.returncode, code, run.stdout)
+            return json.loads(run.stdout)
+
+        def names(answer):
+            return [row["name"] for row in answer.get("left_over", [])]
+
+        def forwarded():
+            return [f"{row['first']}/{row['protocol']}" for row in LAB.web_state()["table"] if row["host"] == BOX]
+
+        def clear():
+            LAB.stop_daemon(signal.SIGKILL)
+            LAB.clear_state(account)
+            while webs:
+                LAB.stop_router()
+                LAB.end(webs.pop())
+
+        webs = []
+        self.addCleanup(clear)
+        for trouble, again in ((False, ""), (True, "save"), (True, pages)):
+            with self.subTest(trouble=trouble, again=again):
+                clear()
+                LAB.install()
+                self.forget()
+                LAB.start_web("blind")
+                webs.append(LAB.router)
+                self.saved({("tcp", 5001): (BOX, 5001), ("udp", 5003): (BOX, 5003)}, "1,1,tcp,5001,5001", "2,1,udp,5003,5003")
+                made = LAB.read(RECORD)
+                LAB.start_router()  # somebody has switched its UPnP on
+                self.assertIn("5001/tcp, 5003/udp", told(0, "router set --brand Lab --model One --version 1 --upnp yes")["warnings"][0])
+                self.assertEqual(names(told(6, "status")), ["5001/tcp", "5003/udp"], "until the first save")
+                good = LAB.read(account)
+                if trouble:
+                    LAB.write(account, good.replace("p&ss", "wrong"))
+                    answer = told(4, "close 5003/udp")
+                    self.assertEqual(names(answer), ["5001/tcp", "5003/udp"])
+                    self.assertNotIn("5003/udp closed", answer["message"])
+                    self.assertIn("does not accept the user name or the password", answer["message"])
+                    self.assertEqual(names(told(0, "status")), ["5001/tcp", "5003/udp"])
+                    self.assertTrue(LAB.reaches("udp", 5003))
+                    LAB.write(account, good)
+                    told(0, again)
+                    told(0, "save")
+                else:
+                    self.assertIn("5003/udp closed", told(0, "close 5003/udp")["message"])
+                    LAB.write(RECORD, re.sub('hardware="[^"]+"', 'hardware="02:00:00:00:00:99"', made))
+                    self.assertIn("the pages of another router that was at this address", "".join(told(0, "status")["warnings"]))
+                    self.assertNotIn("left_over", told(0, "save"))
+                    self.assertEqual((names(told(0, "status")), LAB.read(RECORD).count("00:99")), ([], 2))
+                    LAB.write(RECORD, "")
+                self.assertEqual(names(told(0, "status")), [])
+                self.assertEqual(forwarded(), ["5001/tcp"] if again == pages else [])
+                self.assertEqual(LAB.read(RECORD).count("router_port"), len(forwarded()))
+                self.assertFalse(LAB.reaches("udp", 5003))
+                if again != "save":  # the pages, as they go, clear the filter of the lab's other router, which does not notice
+                    self.assertTrue(LAB.reaches("tcp", 5001))
 
 
 class Database(unittest.TestCase):
