@@ -39,6 +39,8 @@ struct RouterName {
 struct Target {
     std::string szClient;
     uint16_t nBoxPort = 0;  // 0: nowhere
+
+    bool operator==(const Target& other) const = default;
 };
 
 // One mapping of ours.
@@ -56,6 +58,7 @@ struct Made {
     std::string szHardware = {};  // of the router that it was made at, where the one in front does not show its own
     uint16_t nMore = 0;           // of a range
 
+    bool operator==(const Made& other) const = default;
     // Whether an entry at its place is this one. Routers rewrite texts: until it is shown, what it leads to will do, or
     // our mark. A text that the router gives to everybody's says nothing.
     bool IsEntry(const RouterMapping& entry) const {
@@ -87,6 +90,7 @@ public:
     using Rows = std::map<MappingKey, Made>;
     // szText: what the last Text() was, empty for none. szBoot: what tells this boot from every other one.
     Record(std::string_view szText, std::string szBoot);
+    bool operator==(const Record& other) const = default;
 
     // The rows of one router, to be read and changed; those of the others wait.
     void TurnTo(const RouterName& router);
@@ -108,6 +112,8 @@ private:
         RouterName router;
         MappingKey key;
         Made made;
+
+        bool operator==(const Elsewhere& other) const = default;
     };
 
     RouterName NameOf(const Made& made) const {

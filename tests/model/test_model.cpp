@@ -238,7 +238,7 @@ private:
         }
         mPRecord->TurnTo(Name());
         mPRecord->Prune(mNNow - mNBootAt, mRouter.habits.blBlind);
-        const std::string szRecordBefore = mPRecord->Text();
+        const tavo::Record recordBefore = *mPRecord;
         mNAdds = 0;
         mHabit.nLease = mRouter.habits.blForm ? 0 : 3600;
         tavo::PassResult result;
@@ -270,7 +270,7 @@ private:
             CheckPeace(result);
         }
         if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.enList == tavo::Reply::kOk) {
-            CheckCost(result, mRouter.nRequests - nRequestsBefore, mPRecord->Text() != szRecordBefore);
+            CheckCost(result, mRouter.nRequests - nRequestsBefore, *mPRecord != recordBefore);
         } else {
             mBlAllOpen = false;
         }
@@ -297,8 +297,9 @@ private:
     }
 
     bool Save() {
-        if (!mBlDiskFull) {
-            mSzDisk = mPRecord->Text();
+        if (!mBlDiskFull && mSaved != *mPRecord) {
+            mSaved = *mPRecord;
+            mSzDisk = mSaved->Text();
         }
         return !mBlDiskFull;
     }
@@ -458,6 +459,7 @@ private:
     int mNAdds = 0;                 // of this pass
     std::set<MappingKey> mSetOpen;  // at the last look
     std::string mSzDisk;
+    std::optional<tavo::Record> mSaved;  // what its text is of
     std::unique_ptr<tavo::Record> mPRecord;
     tavo::Habits mHabit;
     int mNBoots = 0;
