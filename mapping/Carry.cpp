@@ -87,6 +87,8 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
     }
     if (reply.IsOk() && (mPlaces.what.blForm || mPlaces.what.blShows)) {
         place.before = mPlaces.rows.try_emplace(place.key, RowOf(place.gone, true, mPlaces.Now())).first->second;
+        place.before->szClient = place.gone.szClient;  // which of the two that the row may be of
+        place.before->nBoxPort = place.gone.nBoxPort;
         if (mPlaces.what.blForm || place.pWanted == nullptr) {
             mRgpGone.push_back(&place);
         }

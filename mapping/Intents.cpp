@@ -31,6 +31,8 @@ bool Intend(Places& places, const Place& place) {
     // What was taken away there is gone when the new one is shown: a form has to be applied, and some only say yes.
     if (place.before && (place.before->szClient != made.szClient || place.before->nBoxPort != made.nBoxPort)) {
         made.other = {place.before->szClient, place.before->nBoxPort};
+    } else if (!place.before && pMade != nullptr && place.enSeen != Seen::kAbsent) {
+        made.other = pMade->other;  // its removal was not answered
     }
     places.rows[place.key] = std::move(made);
     return blNews;

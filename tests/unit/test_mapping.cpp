@@ -267,7 +267,8 @@ public:
         BeforeChange();
         mMapTable.erase({"TCP", mNTornAway});
         const auto it = mMapTable.find(tavo::KeyOf(mapping));
-        return !mBlShows && it != mMapTable.end() && it->second.nBoxPort != mapping.nBoxPort
+        return !mBlShows && mNRemoveCode == tavo::kWireOk && it != mMapTable.end() &&
+                       it->second.nBoxPort != mapping.nBoxPort
                    ? RouterReply{tavo::Reply::kNoSuchEntry, "no such rule"}
                    : MemoryRouter::Remove(mapping);
     }
@@ -300,6 +301,28 @@ public:
     uint16_t mNTornAway = 0;                                              // goes with any other one
     int mNApplied = 0;
 };
+
+// Where a form shows no list: what is there is known however often a change of it takes no effect, or its removal is
+// not answered.
+TEST(Mapping, WhatABlindFormHasIsKnownWhateverWasAskedForSince) {
+    for (const bool blSilent : {false, true}) {
+        FormRouter router;
+        router.mBlShows = false;
+        router.mSzRewritten = "-";
+        Core core;
+        core.habit.nLease = 0;
+        core.Run(router, {Entry(4, 4, "", "tavo:c")});
+        router.mBlApplies = false;
+        core.Run(router, {Entry(4, 9, "", "tavo:c")});
+        const int nCode = blSilent ? int{tavo::kWireTimeout} : int{tavo::kWireOk};
+        router.mNRemoveCode = router.mNAddCode = nCode;
+        core.Run(router, {Entry(4, blSilent ? 9 : 10, "", "tavo:c")});
+        router.mNRemoveCode = router.mNAddCode = tavo::kWireOk;
+        router.mBlApplies = true;
+        core.Run(router, {});
+        EXPECT_TRUE(router.mMapTable.empty()) << blSilent;
+    }
+}
 
 RouterMapping Range(RouterMapping mapping, uint16_t nMore) {
     mapping.nMore = nMore;
