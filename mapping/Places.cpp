@@ -201,7 +201,11 @@ void Places::LookForGone(const PlaceList& rgpPlaces) {
     const bool blForm = what.blForm;  // one look reads the list for all
     const auto fnAbsent = [](Place& place) { place.enSeen = Seen::kAbsent; };
     if (!blForm) {
-        LookAtRanges(rgpPlaces, fnAbsent);
+        LookAtRanges(rgpPlaces, [&](Place& place) {
+            if (place.gone.szClient == around.szBox) {  // a range shows the asker's own mappings
+                fnAbsent(place);
+            }
+        });
     }
     PlaceList rgpOpen;
     std::copy_if(rgpPlaces.begin(), rgpPlaces.end(), std::back_inserter(rgpOpen),

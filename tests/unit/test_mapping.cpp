@@ -324,6 +324,20 @@ TEST(Mapping, WhatABlindFormHasIsKnownWhateverWasAskedForSince) {
     }
 }
 
+// A range shows the asker's own mappings: it says nothing of what was made for another address.
+TEST(Mapping, ARangeSaysNothingOfAFormerAddress) {
+    MemoryRouter router;
+    router.mNRangeCode = tavo::kWireOk;
+    router.mSzRewritten = "upnp";
+    Core core;
+    core.Run(router, Wanted(6));
+    router.mNHidden = 3;
+    router.mBlKeepsRemoved = true;
+    core.szBox = "192.168.1.6";
+    EXPECT_EQ(core.Run(router, {}).rgOutcomes.size(), 6U);
+    EXPECT_TRUE((core.record.Here().contains({"TCP", 3})));
+}
+
 RouterMapping Range(RouterMapping mapping, uint16_t nMore) {
     mapping.nMore = nMore;
     mapping.nLease = 0;
