@@ -7,6 +7,7 @@
 
 #include <CLI/StringTools.hpp>
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <numeric>
 #include <thread>
@@ -65,11 +66,13 @@ bool WaitFor(std::chrono::seconds limit, Function fnDone) {
 }
 
 // Why a save without a status failed, although nothing was in its way beforehand.
-Reply WhyFailed(const StoredRouter& router, const Rules& rules, const SaveResult& result) {
+Reply WhyFailed(const StoredRouter& router, const Rules& rules, const SaveResult& result, bool blPagesAsked) {
     if (result.nProgress < kRulesWritten || !AreStored(rules)) {
         return Failure(
-            "the rules could not be written to /etc/portforward; is the disk full or read-only? Nothing was "
-            "changed: the old rules are in force");
+            std::string("the rules could not be written to /etc/portforward; is the disk full or read-only? ") +
+            (blPagesAsked ? "The old rules are in force, but the router's own pages were told before to take away what "
+                            "they forward: what they forwarded is closed until a save succeeds"
+                          : "Nothing was changed: the old rules are in force"));
     }
     if (router.enWay == Way::kManual) {
         return Failure(
@@ -209,6 +212,19 @@ std::optional<Reply> Unwritable(const Rules& rules) {
     return std::nullopt;
 }
 
+// A signal while the router's own pages take away what they forward: no rule has been handed over, and what runs is not
+// the save.
+int LeaveEarly(bool blJson, Progress& progress) {
+    progress.End();
+    TAVORunKeysRestore();
+    return Print(
+        {.enExit = kFailed,
+         .szMessage = "the save is ended before it stored a rule: the old rules are in force. The router's own "
+                      "pages go on taking away what they forward, so that it is closed until the next "
+                      "'tavoportmap save'"},
+        blJson);
+}
+
 // A signal: once the rules are handed over, the daemon carries on by itself, and only the waiting ends.
 int GoOn(bool blJson, Progress& progress) {
     const bool blHanded = WaitFor(kHandOver, [] { return IsSavingRules() != 0; });
@@ -227,14 +243,15 @@ int GoOn(bool blJson, Progress& progress) {
 
 // The library's call, and for rules that leave none the wait that it leaves out. What pages forward that are not in use
 // goes before: the other way would find its ports taken.
-int CallLibrary(const StoredRouter& router, const std::string& szGateway,
-                std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords, bool blJson, SaveResult& result,
-                std::vector<PublishedLeftOver>& rgLeft) {
+int CallLibrary(bool blClearsPages, const std::string& szGateway, std::vector<__tag_TAVO_ROUTER_RULE>& rgRecords,
+                bool blJson, SaveResult& result, std::vector<PublishedLeftOver>& rgLeft) {
     Progress progress(blJson);
-    const OnSignal signals([&] { return GoOn(blJson, progress); });
-    if (router.enWay != Way::kManual && HavePagesMade()) {
+    std::atomic<bool> blClears = blClearsPages;
+    const OnSignal signals([&] { return blClears ? LeaveEarly(blJson, progress) : GoOn(blJson, progress); });
+    if (blClearsPages) {
         progress.Show(kPagesCleared, "having the router's own pages take away what they forward");
         rgLeft = TakeAwayByPages();
+        blClears = false;
     }
     const int nResult = TLibSaveRules(
         szGateway.c_str(), static_cast<int>(rgRecords.size()), rgRecords.data(), false, &result,
@@ -256,12 +273,13 @@ Reply SaveRecords(const StoredRouter& router, const std::string& szGateway, cons
         return *keys.Obstacle();
     }
     const time_t nStart = std::time(nullptr);
-    const int nResult = CallLibrary(router, szGateway, rgRecords, blJson, result, rgLeft);
+    const bool blClearsPages = router.enWay != Way::kManual && HavePagesMade();
+    const int nResult = CallLibrary(blClearsPages, szGateway, rgRecords, blJson, result, rgLeft);
     if (nResult == 0) {
         keys.Keep();
     }
     if (nResult != 0 && result.nStatus == TAVO_ROUTER_STATUS_NONE) {
-        return WhyFailed(router, rules, result);
+        return WhyFailed(router, rules, result, blClearsPages);
     }
     const auto published = PublishedSince(router, rules, nStart);
     const auto unsaid = nResult == 0 && !published ? Unsaid(router) : std::nullopt;

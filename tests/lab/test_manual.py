@@ -277,6 +277,41 @@ class Manual(unittest.TestCase):
                 if again != "save":  # the pages, as they go, clear the filter of the lab's other router, which does not notice
                     self.assertTrue(LAB.reaches("tcp", 5001))
 
+    def test_a_save_that_ends_while_the_pages_clear_says_so(self):
+        """By a signal, or since the rules cannot be written."""
+        account = "/etc/portforward/router_account.conf"
+        self.addCleanup(LAB.clear_state, account)
+        self.addCleanup(LAB.stop_daemon, signal.SIGKILL)
+        for cut in ("signal", "read-only"):
+            with self.subTest(cut=cut):
+                LAB.install()
+                self.forget()
+                LAB.start_web("blind")
+                web = LAB.router
+                self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+                LAB.start_router()
+                LAB.run("box", f"{BUILD}/cli/tavoportmap router set --brand Lab --model One --version 1 --upnp yes")
+                if cut == "signal":
+                    os.kill(web.pid, signal.SIGSTOP)
+                    run = LAB.start("box", f"{BUILD}/cli/tavoportmap", "--json", "close", "5001", stdout=-1, text=True)
+                    wait_for(lambda: LAB.processes_of(f"{TOOL} --take-away"), 5, "the pages are asked")
+                    os.kill(run.pid, signal.SIGINT)
+                    told = run.communicate(timeout=20)[0]
+                    os.kill(web.pid, signal.SIGCONT)
+                    self.assertIn("ended before it stored a rule", told)
+                    wait_for(lambda: not LAB.processes_of(f"{TOOL} --take-away"), 20, "the pages are done")
+                else:
+                    for command in ("mount --bind {0} {0}", "mount -o remount,bind,ro {0}"):
+                        os.system(command.format("/etc/portforward"))
+                    told = LAB.run("box", f"{BUILD}/cli/tavoportmap --json save", check=False).stdout
+                    os.system("umount /etc/portforward")
+                    self.assertNotIn("Nothing was changed", told)
+                    self.assertIn("is closed until a save succeeds", told)
+                self.assertIn('enabled="1"', LAB.read("/etc/portforward/rule.conf"))
+                LAB.stop_router()
+                LAB.end(web)
+                LAB.clear_state(account)
+
 
 class Database(unittest.TestCase):
     def test_operations_that_cannot_be_performed(self):
