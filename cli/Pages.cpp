@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <ctime>
 #include <filesystem>
 
 #include "Child.h"
@@ -45,11 +46,15 @@ std::optional<Published> LeftByPages() {
 }
 
 std::vector<PublishedLeftOver> TakeAwayByPages() {
+    const time_t nStart = std::time(nullptr);
     OutputOf({kProgram, "--take-away"}, kTakeAway, kMostBytes);
     auto left = LeftByPages();
     const auto published = ReadPublished(kName);
-    if (published && !published->blSwitchedOn) {
+    if (published && !published->blSwitchedOn && published->nAt >= nStart) {  // else that run did not come to its end
         left = published;
+    }
+    if (!left && HavePagesMade()) {
+        return {{"what their record has", "", fmt::format("{} did not say what that is", kProgram), std::nullopt}};
     }
     return left ? left->rgLeftOver : std::vector<PublishedLeftOver>();
 }

@@ -1155,6 +1155,16 @@ class Tool(unittest.TestCase):
                 self.assertEqual(done in told["message"], not names, told)
                 self.assertEqual("pages, which are not in use any more, still forward 7000-7004/both, 443/tcp" in told["message"], bool(names))
         self.assertEqual(self.in_force()[0]["enabled"], False)
+        put(record, row.format(GATEWAY, "", "TCP", 443, 0))
+        for script, named in (("exit 1", ["what their record has"]),  # and an older run's word does not count
+                              (f'[ "$1" = --left ] && exec {BUILD}/programs/tavoportforward --left; exit 1', ["443/tcp"])):
+            os.unlink(program)
+            put(program, f"#!/bin/sh\n{script}\n")
+            os.chmod(program, 0o755)
+            self.keep(alive=False)
+            self.publish(1, name="tavoportforward", protocol="pages", left_over=[], switched_on=False, at=1000)
+            code, told = self.json("off", **WRITES)
+            self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (REFUSED, named), told)
 
     def test_status_takes_nobodys_word_but_roots(self):
         path = "/run/tavo/upnpd.json"
