@@ -9,8 +9,10 @@
 #include <chrono>
 #include <cstdio>
 #include <map>
+#include <string>
 #include <vector>
 
+#include "Text.h"
 #include "naive_conflicts.h"
 
 namespace {
