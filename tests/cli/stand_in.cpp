@@ -35,10 +35,15 @@ bool Wants(const char* szVariable, const char* szWord) {
     return szWanted != nullptr && std::strstr(szWanted, szWord) != nullptr;
 }
 
+// The words of a variable, and those that stand for it where the test wants nothing.
+std::istringstream Wanted(const char* szVariable, const char* szElse) {
+    const char* szWanted = std::getenv(szVariable);
+    return std::istringstream(szWanted == nullptr ? szElse : szWanted);
+}
+
 // What the n-th word says of the checks of the network.
 std::string Check(int n) {
-    const char* szWanted = std::getenv("TAVO_CHECKS");
-    std::istringstream wanted(szWanted == nullptr ? "" : szWanted);
+    std::istringstream wanted = Wanted("TAVO_CHECKS", "");
     std::string szWord;
     for (int i = 0; i <= n; ++i) {
         wanted >> szWord;
@@ -61,8 +66,7 @@ void Store(int nRules, const __tag_TAVO_ROUTER_RULE* rgRules) {
 int TLibSaveRules(const char*, int nRules, __tag_TAVO_ROUTER_RULE* rgRules, bool,
                   __tag_TAVO_ROUTER_SAVE_RULE_RESULT* pResult,
                   void (*pfnCallback)(const __tag_TAVO_ROUTER_SAVE_RULE_RESULT*, void*), void* pData) {
-    const char* szWanted = std::getenv("TAVO_SAVE");
-    std::istringstream wanted(szWanted == nullptr ? "-1 0" : szWanted);
+    std::istringstream wanted = Wanted("TAVO_SAVE", "-1 0");
     int nResult = -1;
     wanted >> nResult;
     if (Wants("TAVO_SAVE", "write")) {
@@ -87,8 +91,7 @@ int TLibSaveRules(const char*, int nRules, __tag_TAVO_ROUTER_RULE* rgRules, bool
 
 int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
                      void (*pfnCallback)(const __tag_TAVO_ROUTER_DETECT_RESULT*, void*), void* pData, bool) {
-    const char* szWanted = std::getenv("TAVO_DETECT");
-    std::istringstream wanted(szWanted == nullptr ? "-1" : szWanted);
+    std::istringstream wanted = Wanted("TAVO_DETECT", "-1");
     int nResult = -1;
     wanted >> nResult >> pResult->errCode >> pResult->nEnvFlags >> pResult->nPublicIPLevel >> pResult->enSupportUpnp >>
         pResult->enSupportNatpmp >> pResult->nMaxRule;
@@ -122,7 +125,7 @@ int TLibDetectRouter(__tag_TAVO_ROUTER_DETECT_RESULT* pResult,
 
 // UPnP is answered where the detection has a word on it, and with "able" whatever it has.
 bool UpnpDetector::IsAbleToGetBrandModelVersion() {
-    std::istringstream wanted(std::getenv("TAVO_DETECT") == nullptr ? "" : std::getenv("TAVO_DETECT"));
+    std::istringstream wanted = Wanted("TAVO_DETECT", "");
     int nSupport = 0;
     for (int i = 0; i < 5; ++i) {
         wanted >> nSupport;
@@ -131,7 +134,7 @@ bool UpnpDetector::IsAbleToGetBrandModelVersion() {
 }
 
 int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
-    std::istringstream wanted(std::getenv("TAVO_WORD") == nullptr ? "1 -1" : std::getenv("TAVO_WORD"));
+    std::istringstream wanted = Wanted("TAVO_WORD", "1 -1");
     std::string szOutside;
     int nKind = 0;
     wanted >> pWord->nThere >> pWord->nNatpmp >> szOutside >> nKind;
@@ -143,7 +146,7 @@ int TAVONetGatewayAsk(TAVO_NET_GATEWAY_WORD* pWord) {
 int TLibTestUpnpCompatibility(int, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* pResult,
                               void (*pfnCallback)(const __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT*, void*),
                               void* pData, bool) {
-    std::istringstream wanted(std::getenv("TAVO_COMPAT"));
+    std::istringstream wanted = Wanted("TAVO_COMPAT", "-1 0 -");
     int nResult = -1;
     int nMaxRule = 0;
     std::string szBrand, szSupport;
@@ -171,7 +174,7 @@ int TLibTestUpnpCompatibility(int, __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT* 
 }
 
 int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TAVO_LIBTAVOPORTMAP_ERR*, bool) {
-    std::istringstream wanted(std::getenv("TAVO_REACH"));
+    std::istringstream wanted = Wanted("TAVO_REACH", "");
     for (int i = 0; i < nRules && wanted >> rgRules[i].enTestStatus; ++i) {
         std::string szWord;
         if (rgRules[i].enTestStatus == 0 && wanted >> szWord) {
@@ -182,8 +185,7 @@ int TLibTestRules(int nRules, __tag_TAVO_ROUTER_RULE* rgRules, __tag_TAVO_LIBTAV
 }
 
 int TLibGetRouterDetectResult(__tag_TAVO_ROUTER_DETECT_RESULT* pResult) {
-    const char* szWanted = std::getenv("TAVO_LAST");
-    std::istringstream wanted(szWanted == nullptr ? "" : szWanted);
+    std::istringstream wanted = Wanted("TAVO_LAST", "");
     std::string szBrand;
     wanted >> pResult->enSupportUpnp >> szBrand;
     Fill(pResult->szBrand, szBrand.c_str());
@@ -237,7 +239,7 @@ int TAVOUpnpInit(int nLimitSeconds, int) {
 }
 
 int TAVOUpnpPortMappingGet(int nIndex, TAVO_UPNP_PORT_MAPPING* pMapping) {
-    std::istringstream wanted(std::getenv("TAVO_USED"));
+    std::istringstream wanted = Wanted("TAVO_USED", "");
     std::string szItem;
     for (int i = 0; i <= nIndex; ++i) {
         if (!(wanted >> szItem)) {
