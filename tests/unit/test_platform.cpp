@@ -278,7 +278,7 @@ TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {
         TAVOPFConfFree(pConf);
     }
     const std::string rgszRefused[] = {"[1]\nk=1\n[" + std::string(1024, 'x') + "]\nk=2\n", szMany + "[]\n",
-                                       std::string("[1]\nk=\0\n", 9)};
+                                       std::string("[1]\nk=\0\n", 8)};
     for (const std::string& szText : rgszRefused) {
         Write("/etc/portforward/rule.conf", szText);
         EXPECT_EQ(TAVOPFRuleGet(), nullptr);
