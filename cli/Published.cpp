@@ -18,9 +18,9 @@ namespace tavo::cli {
 
 namespace {
 
-constexpr off_t kMostBytes = 32 << 20;      // every port of both protocols, with room for words
-constexpr size_t kMostText = 1023;          // bytes of one text; the rest is dropped
-constexpr size_t kMostEntries = 2 * 65536;  // ports of both protocols
+constexpr off_t kMostBytes = 32 << 20;        // every port of both protocols, with room for words
+constexpr size_t kMostText = 1023;            // bytes of one text; the rest is dropped
+constexpr size_t kMostEntries = 2UL * 65536;  // ports of both protocols
 constexpr int kMostPort = 65535;
 constexpr char kPagesProgram[] = "tavoportforward";
 constexpr std::array<const char*, 4> kStates = {"unknown", "open", "refused", "waiting"};

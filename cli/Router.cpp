@@ -105,7 +105,7 @@ Reply ReadPassword(const Wish& wish, RouterConf& conf) {
     std::optional<std::string> szPassword;
     if (!wish.szPasswordFile.empty()) {
         szPassword = ReadSecret(wish.szPasswordFile);
-    } else if (wish.blAskPassword || wish.szUser.value_or("") != "") {
+    } else if (wish.blAskPassword || !wish.szUser.value_or("").empty()) {
         szPassword = AskSecret("password of the router's account: ");
     } else {
         return {};

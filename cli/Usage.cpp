@@ -210,7 +210,7 @@ std::string Join(const std::vector<std::string>& rgszWords) {
 
 CLI::Validator OneOf(std::vector<std::string> rgszWords) {
     return CLI::Validator(
-        [rgszWords](std::string& szWord) -> std::string {
+        [rgszWords = std::move(rgszWords)](std::string& szWord) -> std::string {
             if (std::find(rgszWords.begin(), rgszWords.end(), szWord) != rgszWords.end()) {
                 return "";
             }

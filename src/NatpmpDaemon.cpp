@@ -20,7 +20,6 @@ constexpr int kRemapCalls = 22;
 constexpr unsigned kCallRetrySeconds = 1;
 
 using tavo::lib::AtBorder;
-using tavo::lib::LogError;
 using tavo::lib::Refuse;
 
 constexpr tavo::lib::DaemonControl kControl{kFile, tavo::lib::kNatpmpd, tavo::lib::kUpnpd, "/var/run/natpmpd.pid"};

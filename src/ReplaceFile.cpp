@@ -121,7 +121,7 @@ std::string UniqueName(const char* szPath, AsideFor enFor) {
         // The name is only ever renamed to, never opened, and its directory is root's own.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
-        mktemp(szRandom.data());
+        mktemp(szRandom.data());  // NOLINT(clang-analyzer-security.insecureAPI.mktemp)
 #pragma GCC diagnostic pop
         szRandom.erase(0, szRandom.size() - kSuffixSize);
         szName = szPath + Unmistakable(szRandom, enFor == AsideFor::kReport);

@@ -16,7 +16,6 @@ constexpr char kFile[] = "src/RouterUpnpDBUserWriter.cpp";
 
 using tavo::lib::AtBorder;
 using tavo::lib::kUpnpUserDb;
-using tavo::lib::LogError;
 using tavo::lib::Refuse;
 
 }  // namespace

@@ -69,8 +69,7 @@ Tool::~Tool() {
     if (mFd >= 0) {
         close(mFd);
     }
-    int nLeft = 0;
-    while (!HasEnded() && (nLeft = MillisecondsLeft()) > 0) {
+    while (!HasEnded() && MillisecondsLeft() > 0) {
         usleep(1000);
     }
     if (mPid > 0) {

@@ -19,7 +19,6 @@ constexpr unsigned kReadRetrySeconds = 1;
 
 using tavo::lib::AtBorder;
 using tavo::lib::Hash;
-using tavo::lib::LogError;
 using tavo::lib::Refuse;
 
 constexpr tavo::lib::DaemonControl kControl{kFile, tavo::lib::kUpnpd, tavo::lib::kNatpmpd, "/var/run/upnpd.pid"};

@@ -350,8 +350,7 @@ int ToArray(int& nCount, __tag_TAVO_ROUTER_RULE** ppRules, const _tag_tavo_pf_co
             }
             FillRecord(rgRules[i], fields);
         }
-        *ppRules = rgRules;
-        pBlock.release();
+        *ppRules = static_cast<__tag_TAVO_ROUTER_RULE*>(pBlock.release());
         return 1;
     });
 }

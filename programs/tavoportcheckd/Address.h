@@ -24,7 +24,8 @@ public:
     Address Owner() const;
     // May be told by a proxy: one single host that is not this one.
     bool IsForeignHost() const;
-    auto operator<=>(const Address& other) const = default;
+    // clang-tidy 14 takes the zero that the compiler itself compares with for a null pointer.
+    auto operator<=>(const Address& other) const = default;  // NOLINT(modernize-use-nullptr)
 
 private:
     Address() = default;

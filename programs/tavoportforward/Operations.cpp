@@ -104,11 +104,11 @@ bool ReadKey(Operation& operation, const std::string& szKey, const std::string& 
     if (szKey == "expect status") {
         return ReadStatusList(szValue, operation.rgnStatus);
     }
-    if (szKey == "expect text" || Suffix(szKey, "expect text") != "") {
+    if (szKey == "expect text" || !Suffix(szKey, "expect text").empty()) {
         operation.rgszExpect.push_back(szValue);
         return !szValue.empty();
     }
-    if (szKey == "reject text" || Suffix(szKey, "reject text") != "") {
+    if (szKey == "reject text" || !Suffix(szKey, "reject text").empty()) {
         operation.rgszReject.push_back(szValue);
         return !szValue.empty();
     }

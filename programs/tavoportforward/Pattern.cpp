@@ -83,8 +83,8 @@ std::optional<std::vector<Captures>> Pattern::FindAll(const std::string& szText,
         const PCRE2_SIZE* pOffsets = pcre2_get_ovector_pointer(pData.get());
         Captures captures;
         for (uint32_t i = 1; i < static_cast<uint32_t>(nGroups); ++i) {
-            const PCRE2_SIZE nBegin = pOffsets[2 * i];
-            const PCRE2_SIZE nEnd = pOffsets[2 * i + 1];
+            const PCRE2_SIZE nBegin = pOffsets[2UL * i];
+            const PCRE2_SIZE nEnd = pOffsets[2UL * i + 1];
             if (nBegin == PCRE2_UNSET || nEnd < nBegin || nEnd - nBegin > kMaxCapture) {
                 continue;
             }

@@ -42,7 +42,6 @@ constexpr auto kRemoveLimit = std::chrono::seconds(30);
 // After a signal: a request under way is left within a second, and a router that is silent gets two more.
 constexpr int kHastyCallMilliseconds = 700;
 constexpr auto kHastyLimit = std::chrono::seconds(10);  // for a router that answers
-constexpr int kPollMilliseconds = 20;
 constexpr size_t kOrderSize = 16;
 constexpr size_t kMostOrders = 16;
 constexpr int kBacklog = 4;

@@ -18,9 +18,9 @@ namespace {
 using tavo::MappingKey;
 using tavo::RouterMapping;
 
-constexpr int kEvents = 150;                // of one life
-constexpr int64_t kMostBetween = 3 * 3600;  // seconds from one event to the next
-constexpr int kRetrySeconds = 10;           // as the daemons wait after a pass that failed
+constexpr int kEvents = 150;                 // of one life
+constexpr int64_t kMostBetween = 3L * 3600;  // seconds from one event to the next
+constexpr int kRetrySeconds = 10;            // as the daemons wait after a pass that failed
 constexpr uint16_t kPorts = 12;
 constexpr size_t kStory = 60;  // events that are told of a life that failed
 constexpr char kStranger[] = "192.168.1.9";
@@ -434,8 +434,9 @@ private:
         }
         for (const auto& [key, entry] : mRouter.mMapTable) {
             const bool blOurs = entry.blBox && mRouter.At(key) != nullptr;
-            const bool blWanted = std::any_of(mRgWanted.begin(), mRgWanted.end(),
-                                              [&](const RouterMapping& wanted) { return tavo::KeyOf(wanted) == key; });
+            const bool blWanted =
+                std::any_of(mRgWanted.begin(), mRgWanted.end(),
+                            [&key = key](const RouterMapping& wanted) { return tavo::KeyOf(wanted) == key; });
             if (blOurs && !blWanted && !mRouter.habits.blKeepsRemoved &&
                 (!mRouter.habits.blSecure || entry.mapping.szClient == mRouter.szBox)) {
                 Broken("outlives its rule", key);

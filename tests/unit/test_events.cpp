@@ -453,7 +453,7 @@ TEST(HttpRequest, IsReadToABoundAndToAStop) {
         const auto start = std::chrono::steady_clock::now();
         EXPECT_EQ(request.ReadHead(bounded) == tavo::HttpFault::kNone, !blStop);
         if (!blStop) {
-            std::thread late([&, fd = fdThere.Get()] {
+            std::thread late([blRead = blRead, fd = fdThere.Get()] {
                 char szTold[100] = {};
                 EXPECT_TRUE(!blRead || recv(fd, szTold, sizeof(szTold), 0) > 0);
                 EXPECT_EQ(std::string(szTold), blRead ? "HTTP/1.1 100 Continue\r\n\r\n" : "");

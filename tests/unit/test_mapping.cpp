@@ -1325,7 +1325,7 @@ public:
 private:
     RouterReply Lose(RouterReply reply) {
         const bool blLost = mBlSilent || (mNLoseEvery != 0 && ++mNAnswers % mNLoseEvery == 0);
-        return blLost ? IgdReply(tavo::kWireTimeout) : reply;
+        return blLost ? IgdReply(tavo::kWireTimeout) : std::move(reply);
     }
     int mNAnswers = 0;
 };

@@ -32,7 +32,6 @@
 
 namespace {
 
-constexpr char kRuleConf[] = "/etc/portforward/rule.conf";
 constexpr char kRouterConf[] = "/etc/portforward/router.conf";
 constexpr char kSystemConf[] = "/etc/tavoinfo.conf";
 constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";

@@ -371,7 +371,7 @@ public:
     RULE_FILTER Filter() { return {OneIn(3) ? nullptr : Name(), OneIn(2), !OneIn(3), !OneIn(3)}; }
     void Fill(OperationRules& one, OperationRules& copy) {
         one.nRules = copy.nRules = Below(5);
-        const auto nRoom = static_cast<size_t>(one.nRules + 1);
+        const auto nRoom = static_cast<size_t>(one.nRules) + 1;
         one.rgRules = static_cast<OPERATION_RULE*>(calloc(nRoom, sizeof(OPERATION_RULE)));
         copy.rgRules = static_cast<OPERATION_RULE*>(calloc(nRoom, sizeof(OPERATION_RULE)));
         const bool blPairs = OneIn(2);  // the same port on both sides: few partial matches

@@ -356,7 +356,7 @@ TEST_F(RouterTests, TheClientOrdersWhatIsAskedOfItAndEndsTheDaemonWhenItGivesUp)
         const bool blEnded = TLIBCIsProcAlive(kDaemon) == 0;
         EXPECT_TRUE(std::string(szWhat) == "end" || blEnded == (szOrder == "end"))
             << szWhat << ": its end is waited for";
-        fnWait([&] { return Read("/tmp/orders") == szOrder; });
+        fnWait([&szOrder = szOrder] { return Read("/tmp/orders") == szOrder; });
         TLIBCKill(kDaemon, SIGKILL);
         fnWait([] { return TLIBCIsProcAlive(kDaemon) == 0; });
         EXPECT_EQ(Read("/tmp/orders"), szOrder) << szWhat;

@@ -154,7 +154,7 @@ TEST(Daemon, PassesFollowTheirSignals) {
          "request whole\nwithdraw\n"}};
     for (const auto& [szWhat, fnOnPass, szStory] : rgCases) {
         std::filesystem::remove(kNames.szResultFile);
-        EXPECT_EQ(InChild([&] {
+        EXPECT_EQ(InChild([&fnOnPass = fnOnPass, &szStory = szStory] {
                       PlayedMapper mapper(fnOnPass);
                       mapper.mNSeconds = szStory == "request whole\nwithdraw\n" ? 60 : 1;
                       return RunPlayed(mapper);

@@ -285,8 +285,9 @@ int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppH
             }
             ++nPairs;
         }
-        *ppHash = pHash;
-        pNew.release();
+        if (pNew) {
+            *ppHash = pNew.release();
+        }
         return nPairs;
     });
 }

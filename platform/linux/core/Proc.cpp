@@ -24,8 +24,6 @@
 #include "ground/Unit.h"
 #include "tavo/core.h"
 
-extern char** environ;
-
 namespace {
 
 constexpr size_t kKernelNameSize = 15;

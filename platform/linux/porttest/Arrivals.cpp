@@ -101,7 +101,7 @@ void Arrivals::TakePackets() {
         iphdr ip = {};
         tcphdr tcp = {};
         std::memcpy(&ip, rgPacket, sizeof(ip));
-        const size_t nHeader = ip.ihl * 4U;
+        const size_t nHeader = ip.ihl * 4UL;
         // What this box sends to itself is seen here too.
         if (from.sll_pkttype == PACKET_HOST && mSetOwn.count(ip.daddr) != 0 && ip.saddr != ip.daddr &&
             static_cast<size_t>(nLength) >= nHeader + sizeof(tcp)) {

@@ -98,16 +98,16 @@ int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* r
         if (nFlags != kTestFlag || nRules < 0 || (rgStatus == nullptr && nRules > 0)) {
             return Fail(TLIBC_ERR_BAD_PARAMETER);
         }
+        const auto nParts = static_cast<size_t>(nRules);
         std::vector<PortQuestion> rgQuestions;
         std::vector<RulePart> rgParts;
-        for (const TAVO_PF_CONF* pRule = pRules; pRule != nullptr && rgParts.size() < static_cast<size_t>(nRules);
-             pRule = pRule->pNext) {
+        for (const TAVO_PF_CONF* pRule = pRules; pRule != nullptr && rgParts.size() < nParts; pRule = pRule->pNext) {
             rgParts.push_back(TakeApart(pRule, rgQuestions));
         }
-        rgParts.resize(static_cast<size_t>(nRules), {{TAVO_PORT_UNKNOWN, "there is no such rule"}});
+        rgParts.resize(nParts, {{TAVO_PORT_UNKNOWN, "there is no such rule"}});
         const std::vector<PortVerdict> rgVerdicts =
             rgQuestions.empty() ? std::vector<PortVerdict>() : TestPorts(rgQuestions);
-        for (size_t i = 0; i < rgParts.size(); ++i) {
+        for (size_t i = 0; i < nParts; ++i) {
             Fill(rgStatus[i], PutTogether(rgParts[i], rgQuestions, rgVerdicts));
             // The library passes on the status alone; the reason is for whoever reads the log.
             tavo::SysLog(LOG_NOTICE, "port test, rule %zu: %s", i + 1, rgStatus[i].szText);
