@@ -143,7 +143,7 @@ int main(int argc, char** argv) {
         return 1;
     }
     const Clock::time_point start = Clock::now();
-    const auto pIgd = tavo::Igd::Find(szGateway, szBox, kDiscoveryMilliseconds, nullptr);
+    const auto pIgd = tavo::Igd::Find(szGateway, szBox, kDiscoveryMilliseconds, nullptr, 0);
     if (pIgd == nullptr) {
         std::fprintf(stderr, "tavo-igd: the gateway %s offers no UPnP port mapping\n", szGateway);
         return 1;

@@ -533,7 +533,7 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
     for (const char* szHost : {kGateway, kBox}) {
         WebServer server(szPage, szHost);
         std::string szPlace = std::string("http://") + szHost + ":" + std::to_string(server.Port()) + "/x";
-        const auto pIgd = tavo::Igd::Find(kGateway, kBox, 300, &szPlace);
+        const auto pIgd = tavo::Igd::Find(kGateway, kBox, 300, &szPlace, 0);
         EXPECT_EQ(pIgd != nullptr, szHost == kGateway) << szHost;
         if (pIgd == nullptr) {
             tavo::HttpClient().Get({szHost, server.Port(), "/nobody"});
@@ -610,7 +610,12 @@ TEST(Notify, EachDeviceOfARouterHasALifeOfItsOwn) {
         lives.IsNews(fnMessage(std::to_string(i), "x"));
         ASSERT_LE(lives.Size(), 64U);
     }
-    EXPECT_FALSE(lives.IsNews("NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nUSN: new\r\nLOCATION: x\r\n\r\n"));
+    // One that takes its leave is forgotten, and it alone.
+    tavo::Lives some;
+    EXPECT_TRUE(some.IsNews(fnMessage("igd", "x")) && some.IsNews(fnMessage("media", "y")));
+    EXPECT_FALSE(some.IsNews("NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nUSN: uuid:igd::upnp:rootdevice\r\n\r\n"));
+    EXPECT_FALSE(some.IsNews(fnMessage("media", "y")));
+    EXPECT_TRUE(some.IsNews(fnMessage("igd", "x")));
 }
 
 }  // namespace

@@ -42,8 +42,11 @@ bool ReadEntry(const XMLElement* pRoot, IgdEntry& mapping) {
 bool ReadKey(const XMLElement* pRoot, IgdEntry& mapping) {
     const auto nRouterPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewExternalPort")));
     mapping.szProtocol = TextOf(FindElement(pRoot, "NewProtocol"));
-    mapping.nRouterPort = nRouterPort.value_or(0);
-    return nRouterPort.has_value() && (mapping.szProtocol == "TCP" || mapping.szProtocol == "UDP");
+    if (!nRouterPort || (mapping.szProtocol != "TCP" && mapping.szProtocol != "UDP")) {
+        return false;
+    }
+    mapping.nRouterPort = *nRouterPort;
+    return true;
 }
 
 // The entries of a listing, which is a document inside the answer. Those that make no sense are left out.
@@ -125,7 +128,6 @@ int Igd::GetAt(int nIndex, IgdEntry& mapping) {
     IgdEntry read;
     if (!ReadKey(answer.Root(), read) || !ReadEntry(answer.Root(), read)) {
         read = {};
-        read.blEnabled = false;
     }
     mapping = std::move(read);
     return kWireOk;

@@ -24,7 +24,7 @@ struct IgdEntry {
     std::string szClient;       // dotted address of the host behind the port
     std::string szDescription;  // printable, bounded
     uint32_t nLease = 0;        // seconds; 0: until the router restarts
-    bool blEnabled = true;
+    bool blEnabled = false;
 };
 
 // The protocol's own codes; they come beside those of WireCode.
@@ -47,7 +47,7 @@ public:
     // tried. pSzLocation (may be null) is tried first, and set to what worked. A search lasts as SearchGateway says.
     // fnStop is kept for the calls that follow.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                                     std::string* pSzLocation, int nLocalPort = 0,
+                                     std::string* pSzLocation, int nLocalPort,
                                      const std::function<bool()>& fnStop = {});
     // The IGD whose description is at a location; null when there is none.
     static std::unique_ptr<Igd> At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp);
