@@ -10,6 +10,7 @@
 
 #include "Text.h"
 #include "naive_conflicts.h"
+#include "src/merge/UsedPorts.h"
 #include "world.h"
 
 namespace {
@@ -210,6 +211,7 @@ TEST_F(Relay, StoredRulesThatCannotBeRead) {
 TEST_F(Relay, WhatABuilderCannotWorkWithIsRefusedAndNamed) {
     OPERATION_RULE opRule = {};
     PortList ports;
+    PortList noPort = {0};
     __tag_TAVO_ROUTER_RULE stored = Stored("tcp", "1", "1", "", true);
     const __tag_TAVO_PORTMAP_RULE request = Request("1", 0);
     OPERATION_RULE* pHeld = &opRule;
@@ -232,7 +234,9 @@ TEST_F(Relay, WhatABuilderCannotWorkWithIsRefusedAndNamed) {
         {[&] { return WriteRouterRules(Host(), &nWritten, rgRoom, 1, &opRule, 1); },
          "rgOpRules[i].routerPortSet is NULL"},
         {[&] { return opRule.routerPortSet = &ports, WriteRouterRules(Host(), &nWritten, rgRoom, 1, &opRule, 1); },
-         "rgOpRules[i].boxPortSet is NULL"}};
+         "rgOpRules[i].boxPortSet is NULL"},
+        {[&] { return opRule.boxPortSet = &noPort, WriteRouterRules(Host(), &nWritten, rgRoom, 1, &opRule, 1); },
+         "TAVOPFIsValidPortNo(0) failed"}};
     for (const auto& [fnCall, szLine] : rgCases) {
         gLog.clear();
         EXPECT_EQ(fnCall(), -1) << szLine;
@@ -328,6 +332,78 @@ TEST_F(Relay, RefusedArgumentsOfAPass) {
     EXPECT_EQ(DeletePortsFromRuleConf(Host(), nullptr, 1, "hop"), -1);
     EXPECT_EQ(gLog, Lines({"Bad parameter, szServiceName shall not be empty",
                            "Bad parameter, 0 < nRuleConfOpRules=1 but rgRuleConfOpRules is NULL"}));
+}
+
+// "E tcp hop 1>3": told in one line what goes, for whose sake, and what a merge fails at.
+TEST_F(Relay, AnObserverIsToldOfEachPairThatGoesAndOfWhatFails) {
+    class Recorder : public MergeObserver {
+    public:
+        static std::string Name(const OPERATION_RULE* pRule) { return pRule == nullptr ? "-" : pRule->szServiceName; }
+        void OnRemoved(const OPERATION_RULE& rule, int nRouterPort, int nBoxPort,
+                       const OPERATION_RULE* pDecider) override {
+            mSzTold += Name(&rule) + " " + std::to_string(nRouterPort) + ">" + std::to_string(nBoxPort) + " " +
+                       Name(pDecider) + "; ";
+        }
+        void OnTorn(const OPERATION_RULE& rule, int nRouterPort, int nBoxPort, const OPERATION_RULE& decider) override {
+            OnRemoved(rule, nRouterPort, nBoxPort, &decider);
+            mSzTold += "torn";
+        }
+        void OnUneven(const OPERATION_RULE& rule) override { mSzTold += Name(&rule) + " uneven"; }
+        std::string mSzTold;
+    };
+    const UsedPorts used{{2}, {3}};
+    const struct {
+        const char* szRules;
+        const char* szOthers;  // null: the ports that other hosts hold
+        int nResult;
+        const char* szTold;
+    } rgCases[] = {
+        {"E tcp hop 1-3>5-7", nullptr, 0, "hop 2>6 -; "},
+        {"E udp hop 1-3>5-7;E all web 2,3,2>7-9", nullptr, 0, "hop 3>7 -; web 2>9 -; web 2>7 -; "},
+        {"E tcp hop 1>5", nullptr, 0, ""},
+        {"E tcp hop 2>5;E tcp web 1,2>5;E tcp hop 2>5", nullptr, -1, "hop 2>5 -; web uneven"},
+        {"E tcp hop 1-3>1-3", "E tcp web 2-3>2-3;E all any 1>1", 0, "hop 3>3 web; hop 2>2 web; hop 1>1 any; "},
+        {"E tcp hop 1>1", "E udp web 1>1", 0, ""},
+        {"E tcp hop 1-2>1-2", "E tcp web 1>2", -1, "hop 2>2 web; torn"},
+        {"E tcp hop 1>1;E tcp any 1>1-2;E tcp hop 1>1", "E tcp web 1>1", -1, "hop 1>1 web; any uneven"}};
+    for (const auto& c : rgCases) {
+        const Set others(c.szOthers == nullptr ? "" : c.szOthers);
+        for (const bool blTold : {true, false}) {  // who is not told is refused all the same
+            Recorder recorder;
+            MergeObserver* pObserver = blTold ? &recorder : nullptr;
+            const Set mine(c.szRules);
+            EXPECT_EQ(c.szOthers == nullptr
+                          ? DeleteUsedPorts(Host(), mine.rgRules, mine.nRules, nullptr, 0, nullptr, used, pObserver)
+                          : DeletePortsFromRules1(Host(), mine.rgRules, mine.nRules, others.rgRules, others.nRules,
+                                                  true, nullptr, nullptr, pObserver),
+                      c.nResult);
+            EXPECT_EQ(recorder.mSzTold, blTold ? c.szTold : "") << c.szRules;
+        }
+    }
+}
+
+// Each of the three passes over a request, and the lists of the ports that other hosts hold.
+TEST_F(Relay, APassThatFailsEndsTheMerge) {
+    const std::tuple<const char*, const char*, const char*> rgCases[] = {
+        {"E tcp hop 1>1", "D tcp hop 1>2", "DeletePortsFromRules1(B->C) failed"},
+        {"E tcp hop 1>1", "E tcp web 1>2", "DeletePortsFromRules1(C->A) failed"},
+        {"E tcp hop 1>5;E tcp hop 2>5", "D tcp hop 1>5", "DeletePortsFromRules1(C->B) failed"},
+        {"E tcp hop 1>5;E tcp hop 2>6", "D tcp hop 1>5", nullptr}};
+    for (const auto& [szAsked, szStored, szLine] : rgCases) {
+        const Set asked(szAsked);
+        const Set stored(szStored);
+        gLog.clear();
+        EXPECT_EQ(DeletePortsFromInputRules(Host(), asked.rgRules, asked.nRules, stored.rgRules, stored.nRules, "hop"),
+                  szLine == nullptr ? 0 : -1);
+        EXPECT_EQ(gLog.empty() ? "" : gLog.back(), szLine == nullptr ? "" : szLine);
+    }
+    PortList ports;
+    OPERATION_RULE rule = {};
+    EXPECT_EQ(DeleteConflictPortsFromOpRule(Host(), rule, {}), -1);
+    EXPECT_EQ(gLog.back(), "opRule.routerPortSet == NULL");
+    rule.routerPortSet = &ports;
+    EXPECT_EQ(DeleteConflictPortsFromOpRule(Host(), rule, {}), -1);
+    EXPECT_EQ(gLog.back(), "opRule.boxPortSet == NULL");
 }
 
 // What the passes never ask: the name turns rules away before a filter that wants nothing is met.

@@ -2,6 +2,7 @@
 // diagnostics' printed forms. The router's table and the box's interfaces are stand-ins.
 #include <gtest/gtest.h>
 
+#include "Border.h"
 #include "HopLink.h"
 #include "InitState.h"
 #include "RouterConflicts.h"
@@ -249,7 +250,15 @@ TEST_F(RelayRouter, InitState) {
         std::erase(gLog, "file=/etc/portforward/router.conf not exists");
         EXPECT_EQ(gLog, c.lines);
     }
+    SetUp();
     auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
+    RunOutOfMemory([&](const auto& fnArm) {
+        enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
+        fnArm();
+        const int nResult = AtBorder(-1, [&] { return GetInitState(&enState); });
+        gNGoodAllocations = -1;
+        EXPECT_EQ(enState, nResult == 0 ? TAVO_ROUTER_INIT_STATE_UPNP_NATPMP : TAVO_ROUTER_INIT_STATE_UNKNOWN);
+    });
     gSzGateway.clear();
     EXPECT_EQ(GetInitState(&enState), -1);
     EXPECT_TRUE(Logged("get gateway ip failed"));
