@@ -55,7 +55,8 @@ public:
         mBlMarkedAtMap = std::filesystem::exists(kNames.szResultFile);
         PassResult result = mResult;
         for (const RouterMapping& wanted : rgWanted) {
-            result.rgOutcomes.push_back(OutcomeOf(wanted, {tavo::PortState::kOpen, mSzWord}));
+            const auto enState = mSzWord == "1" ? tavo::PortState::kOpen : tavo::PortState::kRefused;
+            result.rgOutcomes.push_back(OutcomeOf(wanted, {enState, mSzWord}));
         }
         return result;
     }
@@ -212,6 +213,30 @@ TEST_F(RuleMapping, ThereIsOneDaemonAtTheRouter) {
     mapper.Pass();
     EXPECT_EQ(mapper.TakeCalls(), (Lines{"map 0"}));
     EXPECT_TRUE(IsLockFree(kTurn));
+}
+
+// What is told of a port, while the daemon is switched on: what was told before is known until it is switched off.
+TEST_F(RuleMapping, NewsIsToldOfWhatIsMappedAndForgottenWithTheSwitch) {
+    std::filesystem::remove("/var/lib/tavo/played.told");
+    Played mapper;
+    mapper.mResult.enRouter = tavo::RouterState::kOk;
+    const std::tuple<bool, bool, const char*, const char*> rgPasses[] = {
+        {true, true, "1", ""},
+        {true, false, "728", "on the router: 80/tcp (web): the router's table of ports is full"},
+        {false, false, "1", ""},  // a save has switched it off for a moment
+        {true, false, "1", "on the router now: 80/tcp (web)"},
+        {false, true, "1", ""},
+        {true, true, "728", ""}};
+    for (const auto& [blOn, blRequested, szWord, szTold] : rgPasses) {
+        Switch(blOn);
+        mapper.mSzWord = szWord;
+        gNClockAhead += 120;
+        gLog.clear();
+        mapper.Pass(blRequested);
+        std::erase_if(gLog, [](const std::string& szLine) { return !szLine.starts_with("on the router"); });
+        EXPECT_EQ(gLog, *szTold == '\0' ? Lines() : Lines{szTold}) << szWord;
+    }
+    gNClockAhead = 0;
 }
 
 TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
