@@ -114,6 +114,43 @@ TEST(NetworkChecks, FailAtOnceInABoxWithoutANetwork) {
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(7));
 }
 
+// Two cables: the checks are about the one that leads to the gateway, and else about one that is plugged in.
+TEST(NetworkChecks, AreAboutTheInterfaceThatLeadsToTheGateway) {
+    const auto fnRun = [](const std::string& szCommand) { ASSERT_EQ(TLIBCSystem(szCommand.c_str()), 0) << szCommand; };
+    // One end, until the kernel has told the other one.
+    const auto fnSet = [&](const std::string& szEnd, const std::string& szState, const std::string& szShown) {
+        fnRun("ip link set " + szEnd + " " + szState + " && timeout 9 sh -c 'until ip link show box" + szEnd.back() +
+              " | grep -q \"state " + szShown + "\"; do sleep .02; done'");
+    };
+    for (const std::string szOne : {"0", "1"}) {
+        fnRun("ip link add box" + szOne + " up type veth peer name far" + szOne);
+        fnRun("ip address add 10.9." + szOne + ".5/24 dev box" + szOne);
+        fnSet("far" + szOne, "up", "UP");
+    }
+    const std::tuple<const char*, const char*, int, const char*, int> rgCases[] = {{"10.9.1.1", "", 0, "box1", 0},
+                                                                                   {"10.9.0.1", "", 0, "box0", 0},
+                                                                                   {"10.9.0.5", "", 0, "box0", -1},
+                                                                                   {"10.8.0.1", "", 0, "box0", -1},
+                                                                                   {"", "", 0, "box0", -1},
+                                                                                   {"", "far0", 0, "box1", -1},
+                                                                                   {"10.9.1.1", "far0", 0, "box1", 0},
+                                                                                   {"10.9.0.1", "far0", -1, "box0", 0},
+                                                                                   {"10.9.0.1", "box0", 0, "box1", -1}};
+    for (const auto& [szGateway, szDown, nEnabled, szName, nSet] : rgCases) {
+        SCOPED_TRACE(std::string(szGateway) + " without " + szDown);
+        gSzGateway = szGateway;
+        *szDown == '\0' ? void() : fnSet(szDown, "down", ".*DOWN");
+        char szText[64] = "?";
+        EXPECT_EQ(checkGwIfEnable(szText, sizeof(szText)), nEnabled);
+        EXPECT_STREQ(szText, szName);
+        EXPECT_EQ(checkDefaultGatewaySetting(szText, sizeof(szText)), nSet);
+        EXPECT_STREQ(szText, szGateway);
+        *szDown == '\0' ? void() : fnSet(szDown, "up", "UP");
+    }
+    fnRun("ip link del box0 && ip link del box1");
+    gSzGateway = "192.168.1.1";
+}
+
 TEST(HopProbe, ShowsTheHostItselfAtEveryDistanceAndKeepsItsBounds) {
     const std::tuple<int, int, size_t> rgCases[] = {{1, 1, 1}, {1, 3, 3}, {30, 30, 1}, {29, 31, 2},
                                                     {0, 3, 0}, {3, 2, 0}, {31, 31, 0}};
