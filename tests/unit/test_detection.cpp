@@ -94,10 +94,16 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     EXPECT_EQ(DetectCacheWriter("192.168.1.1").SetType(static_cast<__TAG_TAVO_ROUTER_INIT_STATE>(-1)), 0);
     EXPECT_TRUE(Logged("error: invalid enume type enState=4"));
     gStage.blOn = true;
-    for (const char* szFail : {"brand", "model", "version", "router_detect", "hash"}) {
+    for (const auto& [szFail, szLine] : {std::pair{"brand", "set brand failed"},
+                                         {"model", "set model failed"},
+                                         {"version", "set version failed"},
+                                         {"router_detect", "set type failed"},
+                                         {"hash", "hash malloc failed"}}) {
+        gLog.clear();
         gStage.szFail = szFail;
         gStage.nWorks = 0;
         EXPECT_EQ(SetDetectManualCache("192.168.1.1", "never", "kept", "3"), 0) << szFail;
+        EXPECT_TRUE(Logged(szLine)) << szLine;
     }
     gStage = Stage();
     EXPECT_EQ(Read(SZF_DETECT_MANUAL_CACHE).find("never"), std::string::npos);
@@ -118,7 +124,7 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     Write(SZF_DETECT_MANUAL_CACHE, "nonsense\n");
     DetectCacheReader broken("192.168.1.1");
     EXPECT_EQ(broken.IsSectionExisted(blExisted), 0);
-    EXPECT_TRUE(Logged("Init() failed"));
+    EXPECT_TRUE(Logged("Init() failed") && LoggedFrom("TLIBCFileGetSection(" + SZF_DETECT_MANUAL_CACHE));
     EXPECT_EQ(broken.IsSectionExisted(blExisted), 0);  // loaded once, and for good
     EXPECT_TRUE(Logged("initialize failed"));
 }
@@ -224,7 +230,10 @@ TEST_F(Detection, AirPortPolls) {
         gFnOnSleep = [&] { fnBefore(gNSlept + 2); };  // the poll that follows
         mNetwork.szAnnounced = airPort.nCreated == 1 ? std::optional<std::string>(airPort.szText) : std::nullopt;
         NatpmpDetector detector;
+        gLog.clear();
         EXPECT_TRUE(detector.Start("192.168.1.1"));
+        EXPECT_EQ(Logged("Failed to Get Section [192.168.1.1], so that target router is not natpmp"),
+                  airPort.nCreated == 1 && std::string(airPort.szSupport) == "no");
         EXPECT_EQ(detector.GetSupportNatpmp(), airPort.szSupport);
         EXPECT_EQ(detector.GetUserSettingName(), airPort.szName);
         EXPECT_EQ(detector.GetBrand(), std::string(airPort.szSupport) == "yes" ? "AirPort" : "");
@@ -280,6 +289,7 @@ TEST_F(Detection, FilesThatOthersPlantedInTmpHoldNobody) {
         }
         EXPECT_EQ(UpnpDetector().Start(), blPipe);
         EXPECT_EQ(detector.Start("192.168.1.1"), blPipe);
+        EXPECT_EQ(Logged("another natpmp detector is running"), !blPipe);
     }
     std::filesystem::remove("/tmp/upnp_detector.lock");
     std::filesystem::remove("/tmp/natpmp_detector.lock");
@@ -365,6 +375,9 @@ TEST_F(Detection, DriverInEachNetwork) {
         EXPECT_EQ(result.nEnvFlags, driver.nFlags);
         EXPECT_EQ(result.nMaxRule, driver.nMaxRule);
         EXPECT_TRUE(Logged(driver.szLine));
+        EXPECT_EQ(Logged("Gateway setting is not correct"), mNetwork.nGateway == -1);
+        EXPECT_EQ(Logged("can not get max rule, this router may not in routerdb"),
+                  std::string(driver.szLine) == "fillRouterDetectResult failed");
         EXPECT_FALSE(DetectCache::IsCacheExisted());
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
     }
@@ -540,6 +553,12 @@ TEST_F(Detection, SettingsAfterEachFault) {
          "save config failed", true, 1},
         {"a port that cannot be kept", [](RouterConf&) { gStage.blOn = true, gStage.szFail = "conn_port"; },
          "save config failed", true, 1},
+        {"a word of UPnP that cannot be kept",
+         [](RouterConf&) { gStage.blOn = true, gStage.szFail = "support_router_upnp"; }, "save support upnp failed",
+         true, 1},
+        {"a word of NAT-PMP that cannot be kept",
+         [](RouterConf&) { gStage.blOn = true, gStage.szFail = "support_router_natpmp"; }, "save support natpmp failed",
+         true, 1},
         {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
          "can not save backup file of '/etc/portforward/router.conf.bak'", true, 1},
         {"failed write", [](RouterConf&) { gFnOnConfSet = [] { return -1; }; }, "sync config failed", true, 1},
@@ -565,6 +584,7 @@ TEST_F(Detection, SettingsAfterEachFault) {
         auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
         EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, &enErr, true), -1);
         EXPECT_TRUE(Logged(fault.szLine));
+        EXPECT_EQ(Logged("can not get gateway ip"), gSzGateway.empty());
         EXPECT_EQ(Read(kRouterConf), fault.blKept ? szOld : "");
         EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
         EXPECT_EQ(enErr, fault.nErr);
@@ -626,7 +646,10 @@ TEST_F(Detection, MemoryThatRunsOutHalvesNoResult) {
     gStage.blOn = true;
     gStage.szFail = "run";
     mNetwork.szAnnounced = "[192.168.1.1]\nname=\"a name of some length\"\n";
-    const auto fnCheckRecords = [] {
+    std::set<std::string> said;
+    const auto fnCheckRecords = [&said] {
+        said.insert(gLog.begin(), gLog.end());
+        gLog.clear();
         UpnpDetector upnp;
         NatpmpDetector natpmp;
         const std::string szUpnp = upnp.GetBrand() + upnp.GetModel() + upnp.GetVersion();
@@ -654,7 +677,12 @@ TEST_F(Detection, MemoryThatRunsOutHalvesNoResult) {
         TLibGetRouterDetectResult(&result);
         gNGoodAllocations = -1;
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
+        said.insert(gLog.begin(), gLog.end());
+        gLog.clear();
     });
+    for (const char* szLine : {"fillRouterDetectResult() failed", "memory is not enough", "Failed to alloc hash"}) {
+        EXPECT_TRUE(said.contains(szLine)) << szLine;
+    }
 }
 
 }  // namespace

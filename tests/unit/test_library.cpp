@@ -218,6 +218,8 @@ TEST_F(Library, WhatIsMissingIsRefusedAndNamed) {
         {[&] { return PF_CONF::GetRuleServiceID(szA, nullptr); }, 0, "pConf shall not be NULL"},
         {[&] { return PF_CONF::ToArray(nNumber, nullptr, nullptr); }, 0, "pRgRules is NULL or *pRgRules is not NULL"},
         {[&] { return PF_CONF::FreeArray(nullptr); }, 0, "pConfHead is NULL"},
+        {[] { return RouterRuleConfWriter().GetRuleConf(nullptr); }, 0, "pRuleConfHead is NULL"},
+        {[] { return TestFuncToPorts(nullptr, 8, nullptr); }, -1, "szNumbers is NULL"},
     };
     for (const auto& [fnCall, nResult, szLine] : rgCases) {
         gLog.clear();
@@ -395,6 +397,7 @@ TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
             continue;
         }
         EXPECT_EQ(writer.Sync(), 0) << szFailing;
+        EXPECT_TRUE(LoggedFrom("rename(/etc/portforward/rule.conf, /etc/portforward/rule.conf"));
         EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
         EXPECT_EQ(std::distance(std::filesystem::directory_iterator("/etc/portforward"), {}), 1);
         EXPECT_EQ(writer.Sync(), 1);
@@ -433,6 +436,40 @@ TEST_F(Library, RouterConfWriterKeepsOrDropsOtherGateways) {
     EXPECT_TRUE(Logged("init failed"));
 }
 
+// Where no section of the gateway's can be gone on with, one begins; what stood in the way is said.
+TEST_F(Library, SettingsThatCannotBeGoneOnWithBeginAnew) {
+    const std::string szAnew = "reload previous section failed, and try to create a new section.";
+    const std::tuple<const char*, const char*, std::vector<std::string>> rgCases[] = {
+        {nullptr, "192.168.1.1", {"get router conf failed", szAnew}},
+        {"[10.0.0.1]\nbrand=x\n",
+         "192.168.1.1",
+         {"can not find gatway ip = 192.168.1.1 session in router.conf", szAnew}},
+        {"[192.168.1.1]\n", "192.168.1.1", {}},
+        {"[192.168.1.1]\n", "", {"cannot get gateway router ip", "can not get gateway ip"}}};
+    for (const auto& [szStored, szGateway, rgszLines] : rgCases) {
+        std::filesystem::remove(kRouterConf);
+        if (szStored != nullptr) {
+            Write(kRouterConf, szStored);
+        }
+        gSzGateway = szGateway;
+        gLog.clear();
+        RouterConfWriter writer(true);
+        EXPECT_EQ(writer.SetBrand("new"), gSzGateway.empty() ? 0 : 1);
+        EXPECT_EQ(std::vector<std::string>(gLog.begin(), gLog.begin() + std::min(gLog.size(), rgszLines.size())),
+                  rgszLines);
+    }
+    gSzGateway = "192.168.1.1";
+    std::set<std::vector<std::string>> said;
+    RunOutOfMemory([&](const auto& fnArm) {
+        gLog.clear();
+        fnArm();
+        RouterConfWriter(true).Init();
+        gNGoodAllocations = -1;
+        said.insert(gLog);
+    });
+    EXPECT_TRUE(said.contains({"hash malloc failed", szAnew}));
+}
+
 TEST_F(Library, RouterNames) {
     std::string szBrand, szModel, szVersion;
     char szName[] = "N: W (1.0(2))";
@@ -462,6 +499,11 @@ TEST_F(Library, CompatibilityDatabaseOfTwoFiles) {
     EXPECT_TRUE(RouterUpnpDB("a", "b", "2").GetMaxRule(nMax));
     EXPECT_EQ(nMax, 7);
     EXPECT_FALSE(RouterUpnpDB("", "", "").IsValid());
+    EXPECT_TRUE(Logged("query brand, model, version shall not empty"));
+    std::filesystem::remove("/etc/portforward/router_upnp.db");
+    EXPECT_TRUE(RouterUpnpDB("a", "b", "2").IsValid());
+    EXPECT_TRUE(Logged("/etc/portforward/router_upnp.db is lost, try to recover ..."));
+    EXPECT_TRUE(Logged("/etc/portforward/router_upnp.db recover failed"));
 }
 
 // What the settings of a router say, as each of its readers tells it: the words, "yes" or not, and what it can do.
@@ -484,6 +526,7 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         std::string szUpnp, szNatpmp;
         bool blUpnp = false, blNatpmp = false;
         int nMax = 0;
+        gLog.clear();
         const int rgAnswers[] = {reader.GetSupportUpnp(szUpnp), reader.GetSupportNatpmp(szNatpmp),
                                  reader.GetSupportUpnp(blUpnp), reader.GetSupportNatpmp(blNatpmp),
                                  reader.GetMaxRule(nMax)};
@@ -494,9 +537,13 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
             szWords += (i == 0 ? "" : " ") + (rgAnswers[i] == 1 ? rgszTold[i] : "-");
         }
         EXPECT_EQ(szWords, stored.szWords) << stored.szStored;
+        for (const char* szLine : {"get support upnp fail", "get support natpmp fail"}) {
+            EXPECT_EQ(Logged(szLine), szWords == "- - - - -") << szLine;
+        }
         __tag_TAVO_ROUTER_DESC desc = {true};
         auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
         EXPECT_EQ(TLibGetRouterDesc(stored.szAddress, &desc, &enErr, true), stored.nDescribed) << stored.szStored;
+        EXPECT_EQ(Logged("get support change port failed"), szWords == "no no 0 0 0");
         EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
         EXPECT_FALSE(desc.blSupportChangePort);
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
@@ -512,6 +559,7 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
     }
     auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
     EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", nullptr, &enErr, false), -1);
+    EXPECT_TRUE(Logged("routerDesc is NULL"));
     ASSERT_EQ(TLibTavoPortMapLock(), 0);
     __tag_TAVO_ROUTER_DESC desc = {true};
     EXPECT_EQ(TLibGetRouterDesc("192.168.1.1", &desc, &enErr, true), -1);
@@ -526,27 +574,30 @@ struct Capacity {
     int nStatus;
     int nLimit;
     int nLimit2;
+    const char* szLine;
 };
 
 TEST_F(Library, ManualRouterLimits) {
     const std::string szAll = "tcp=1\nudp=1\ntcp_udp=1\nchange router port=yes\n";
     const Capacity rgCases[] = {
-        {"support range=single\nmax rule=10\n", "1,2,3,5-6", 11, 10, 0},
-        {"max rule=10\n", "1,2,3,5-6", 10, 10, 0},
-        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,3,4,5,6,7,8,9,10,11", 12, 10, 4},
-        {"max rule=0\n[PF range page]\nmax rule=4\n", "1", 10, -1, 0},
-        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,5-6", 0, 0, 0},
+        {"support range=single\nmax rule=10\n", "1,2,3,5-6", 11, 10, 0, "get max range == 0"},
+        {"max rule=10\n", "1,2,3,5-6", 10, 10, 0, "get bl is support page range == 0"},
+        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,3,4,5,6,7,8,9,10,11", 12, 10, 4, "exceed range max port"},
+        {"max rule=0\n[PF range page]\nmax rule=4\n", "1", 10, -1, 0, "exceed max rule, unknown err, nMaxPort=0 "},
+        {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,5-6", 0, 0, 0, ""},
     };
     for (const Capacity& capacity : rgCases) {
         MakeManual("[PF port page]\n" + szAll + capacity.szPages);
         std::filesystem::remove(kRuleConf);
         Rule rule = MakeRule("1", capacity.szPorts);
+        gLog.clear();
         SaveResult result = {};
         const int nResult = TLibSaveRules("192.168.1.1", 1, &rule, true, &result, nullptr, nullptr);
         EXPECT_EQ(nResult, capacity.nStatus == 0 ? 0 : -1) << capacity.szPages;
         EXPECT_EQ(result.nStatus, capacity.nStatus) << capacity.szPages;
         EXPECT_EQ(result.nLimit, capacity.nLimit);
         EXPECT_EQ(result.nLimit2, capacity.nLimit2);
+        EXPECT_EQ(LoggedFrom(capacity.szLine), capacity.nStatus != 0) << capacity.szLine;
         EXPECT_EQ(std::filesystem::exists("/tmp/ran"), nResult == 0);
         EXPECT_EQ(std::filesystem::exists(kRuleConf), nResult == 0);
     }

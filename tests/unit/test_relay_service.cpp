@@ -419,8 +419,10 @@ TEST_F(RelayService, MemoryThatRunsOutLosesNoRule) {
         EXPECT_TRUE(LockIsFree());
         said.insert(gLog.begin(), gLog.end());
     });
-    for (const char* szLine : {"GetInitState() failed", "CreateOperationRulesArray(ruleConf) failed",
-                               "new set<int> failed", "save rule failed", "test port connection failed"}) {
+    for (const char* szLine :
+         {"GetInitState() failed", "CreateOperationRulesArray(ruleConf) failed", "new set<int> failed",
+          "save rule failed", "test port connection failed", "TLibGetRouterConf() failed", "can not get router conf",
+          "pArr is NULL", "TLibParsePorts() for boxPort failed", "malloc() failed"}) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;
     }
 #ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out

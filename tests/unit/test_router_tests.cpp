@@ -217,6 +217,7 @@ TEST_F(RouterTests, EachStepThatFails) {
                 return szSeen.starts_with(step.szLine);
             }));
             EXPECT_EQ(Logged("fillTestCompResult() failed"), !blNamed);
+            EXPECT_EQ(Logged("brand & model & version shall not be all empty"), !blNamed);
             if (const auto shown = mapShown.find(step.szWhat); shown != mapShown.end()) {
                 char szWord[20] = {};
                 TLIBCFileGetKeyValue("/tmp/upnp_test.progress", shown->second.first, szWord, sizeof(szWord), 0);
@@ -267,6 +268,7 @@ TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
     mNetwork.nUpnpInit = 1;
     EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), -1);
     EXPECT_EQ(result.nStatus, 13);
+    EXPECT_TRUE(Logged("TavoUpnpTestInit() failed"));
     EXPECT_EQ(result.nProgress, 20);
     EXPECT_EQ(mClient.rgszCalls.back(), "end");
 
@@ -520,8 +522,10 @@ TEST_F(RouterTests, SurviveMemoryThatRunsOut) {
     const std::string szKnown = Read(kUserDb);
     mClient.rgVerdicts = {2, 2};
     std::set<int> ends;
+    std::string szSaid;
     RunOutOfMemory([&](const auto& fnArm) {
         TestResult result = {};
+        gLog.clear();
         fnArm();
         const int nResult = TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true);
         gNGoodAllocations = -1;
@@ -552,7 +556,16 @@ TEST_F(RouterTests, SurviveMemoryThatRunsOut) {
         gNGoodAllocations = -1;
         EXPECT_EQ(std::filesystem::exists(kUserDb), blKept);
         Write(kUserDb, szKnown);
+        for (const std::string& szLine : gLog) {
+            szSaid += szSaid.find(szLine) == std::string::npos ? szLine + "\n" : "";
+        }
     });
+    for (const char* szLine :
+         {"TLIBCFileGetKeyValue() failed\n", "TLibGetRouterDetectResult() failed\n", "set support failed\n",
+          "set max rule failed\n", "fail add section into [/etc/portforward/router_upnp.db.user]",
+          "fail set section into [", "set router.conf failed\n"}) {
+        EXPECT_NE(szSaid.find(szLine), std::string::npos) << szLine;
+    }
     EXPECT_EQ(ends, (std::set<int>{0, 1}));
 }
 

@@ -362,8 +362,9 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
             said.insert(gLog.begin(), gLog.end());
         });
     }
-    for (const char* szLine : {"fail to get brand", "get max rule fail", "add rule failed", "can not get max ports",
-                               "sync rule to file fail", "failed to allocate list"}) {
+    for (const char* szLine :
+         {"fail to get brand", "get max rule fail", "add rule failed", "can not get max ports",
+          "sync rule to file fail", "failed to allocate list", "malloc fail: szRemap", "get router conf failed"}) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;
     }
 }

@@ -102,6 +102,16 @@ inline bool Logged(const std::string& szLine) {
     return false;
 }
 
+// Whether a line begins so; numbers and places follow.
+inline bool LoggedFrom(const std::string& szBegin) {
+    for (const std::string& szSeen : gLog) {
+        if (szSeen.starts_with(szBegin)) {
+            return true;
+        }
+    }
+    return false;
+}
+
 // Whether another process could take the lock now.
 inline bool IsLockFree(const char* szPath) {
     int fd = -1;
