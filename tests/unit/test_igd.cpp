@@ -508,18 +508,31 @@ TEST_F(SearchTest, TheGatewaysOwnAnnouncementsAreNews) {
     inet_pton(AF_INET, "239.255.255.250", &mFrom.sin_addr);
     mFrom.sin_family = AF_INET;
     mFrom.sin_port = htons(1900);
-    const auto fnIsNews = [&](const char* szFrom, const std::string& szBoot) {
+    // The number stands at the end of a datagram of so many bytes at least.
+    const auto fnSay = [&](const char* szFrom, const std::string& szBoot, size_t nBytes = 0) {
         const tavo::Descriptor fd = SocketAt(szFrom, 0);
         in_addr own = {};
         inet_pton(AF_INET, szFrom, &own);
         setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &own, sizeof(own));
-        Say(fd, "NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: u\r\nBOOTID.UPNP.ORG: " + szBoot + "\r\n\r\n");
-        return announcements.TakeNews(kGateway);
+        const std::string szText = "NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: u\r\nBOOTID.UPNP.ORG: ";
+        const size_t nLength = szText.size() + szBoot.size();
+        Say(fd, szText + std::string(std::max(nBytes, nLength) - nLength, ' ') + szBoot);
     };
-    EXPECT_FALSE(fnIsNews(kBox, "1"));
-    EXPECT_TRUE(fnIsNews(kGateway, "1"));
-    EXPECT_FALSE(fnIsNews(kGateway, "1"));
-    EXPECT_TRUE(fnIsNews(kGateway, "2"));
+    const std::tuple<const char*, const char*, size_t, bool> rgCases[] = {
+        {kBox, "1", 0, false},    {kGateway, "1", 0, true},    {kGateway, "1", 0, false},
+        {kGateway, "2", 0, true}, {kGateway, "3", 4096, true}, {kGateway, "4", 4097, false}};
+    for (const auto& [szFrom, szBoot, nBytes, blNews] : rgCases) {
+        fnSay(szFrom, szBoot, nBytes);
+        EXPECT_EQ(announcements.TakeNews(kGateway), blNews) << szFrom << " " << szBoot;
+    }
+    fnSay(kGateway, "5");
+    EXPECT_TRUE(announcements.TakeNews(kGateway));
+    for (int i = 1; i <= 65; ++i) {  // of a flood, so many at once
+        fnSay(kGateway, i == 64 ? "6" : i == 65 ? "7" : "5");
+    }
+    for (const bool blNews : {true, true, false}) {
+        EXPECT_EQ(announcements.TakeNews(kGateway), blNews);
+    }
     announcements.Listen("no address");
     EXPECT_EQ(announcements.Fd(), -1);
 }
@@ -606,9 +619,18 @@ TEST(Notify, EachDeviceOfARouterHasALifeOfItsOwn) {
     for (const auto& [szDevice, szPlace, blNews] : rgCases) {
         EXPECT_EQ(lives.IsNews(fnMessage(szDevice, szPlace)), blNews) << szDevice << " " << szPlace;
     }
-    for (int i = 0; i < 10000; ++i) {
-        lives.IsNews(fnMessage(std::to_string(i), "x"));
-        ASSERT_LE(lives.Size(), 64U);
+    for (const int nDevices : {64, 65}) {  // of those that it cannot keep, it keeps none
+        tavo::Lives many;
+        for (int i = 0; i < nDevices; ++i) {
+            EXPECT_TRUE(many.IsNews(fnMessage(std::to_string(i), "x")));
+        }
+        EXPECT_EQ(many.IsNews(fnMessage("0", "x")), nDevices == 65);
+        EXPECT_FALSE(many.IsNews(fnMessage(std::to_string(nDevices - 1), "x")));
+    }
+    for (const size_t nSame : {255, 256}) {  // two that differ behind a life's bound are one
+        const std::string szLife(nSame, 'x');
+        lives.IsNews(fnMessage("igd", szLife + "a"));
+        EXPECT_EQ(lives.IsNews(fnMessage("igd", szLife + "b")), nSame == 255) << nSame;
     }
     // One that takes its leave is forgotten, and it alone.
     tavo::Lives some;

@@ -22,7 +22,6 @@ public:
     // Whether a device is heard for the first time, after its goodbye too, or has another life.
     bool IsNews(std::string_view szMessage);
     void Forget() { mMapLives.clear(); }
-    size_t Size() const { return mMapLives.size(); }
 
 private:
     std::map<std::string, std::string> mMapLives;  // by the name that a device has for itself
