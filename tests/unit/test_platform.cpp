@@ -398,7 +398,10 @@ TEST(OwnFile, StandsWhereOthersHavePutSomethingOrItIsSaidThatItDoesNot) {
     for (const auto& [szWhat, fnPlant, nErrno] : rgCases) {
         std::filesystem::remove(kOwn);
         fnPlant();
+        gLog.clear();
         EXPECT_EQ(tavo::MakeOwnFile(kOwn), nErrno == 0) << szWhat;
+        EXPECT_EQ(Logged("was not ours alone; another file stands there now"),
+                  nErrno == 0 && std::string(szWhat) != "nothing");
         EXPECT_TRUE(nErrno == 0 || errno == nErrno) << szWhat;
         struct stat status = {};
         EXPECT_EQ(lstat(kOwn, &status) == 0 && status.st_mode == (S_IFREG | 0600), nErrno == 0) << szWhat;

@@ -245,6 +245,7 @@ TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
     Write(kRules, "this is no rule file\n");
     mapper.Pass(true);
     EXPECT_EQ(Result(), "rule.conf unreadable\n");
+    EXPECT_TRUE(Logged("rule file cannot be read; the router's mappings stay as they are"));
     EXPECT_EQ(mapper.TakeCalls(), Lines()) << "not knowing the rules is no reason to take anything away";
     Write(kRules, std::string(kRule) + "[2]\nenabled=1\nprotocol name=tcp\nr_port=1-2\ns_port=1\n");
     mapper.mResult.enRouter = tavo::RouterState::kOk;

@@ -110,13 +110,15 @@ int RunPlayed(const PlayedMapper& mapper, std::string szOption = "--foreground",
                             rgszArguments, kNames, [&] { return std::make_unique<PlayedMapper>(mapper); });
 }
 
-// Each look at the clock takes a second, so that the limits go by faster; tells what it took.
+// Each look at the clock takes a second, so that the limits go by faster; tells what it took, and its last word.
 int RunFast(const PlayedMapper& mapper, const std::string& szOption, const std::string& szSecond = "") {
     const auto start = tavo::BootClock::now();
+    gLog = {""};
     gNClockStep = 1;
     const int nExit = RunPlayed(mapper, szOption, szSecond);
     gNClockStep = 0;
-    PlayedMapper::Tell(std::to_string((tavo::BootClock::now() - start) / std::chrono::seconds(1)) + " s");
+    PlayedMapper::Tell(std::to_string((tavo::BootClock::now() - start) / std::chrono::seconds(1)) + " s " +
+                       gLog.back());
     return nExit;
 }
 
@@ -184,6 +186,8 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         bool blSlow = false;
         const char* szSecond = "";
     };
+    const char* szStays = "21 s played that runs does not end (lock /run/played.lock)\n";  // with the first look
+    const char* szTaken = "0 s played is running (lock /run/played.lock)\n";
     const Case rgCases[] = {
         {"--help", 0},
         {"--hepl", 2},
@@ -191,15 +195,16 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         {.szOption = "--foreground", .nExit = 2, .szSecond = "--stop"},
         {"--make-locks", 0},
         {"--hand-over", 0},
-        {"--hand-over", 1, "21 s\n", true},  // with the first look at the clock
-        {"--foreground", 1, "0 s\n", true},
-        {.szOption = "--foreground", .nExit = 1, .szStory = "21 s\n", .blHeld = true, .szSecond = "--take-over"},
+        {"--hand-over", 1, szStays, true},
+        {"--foreground", 1, szTaken, true},
+        {.szOption = "--foreground", .nExit = 1, .szStory = szStays, .blHeld = true, .szSecond = "--take-over"},
         {.szOption = "--foreground", .nExit = 0, .szStory = "request cut\n", .szSecond = "--take-over"},
-        {"", 1, "0 s\n", true},
+        {"", 1, szTaken, true},
         {"--stop", 0, "withdraw\n"},
         {"--stop", 0, "", false, false},
-        {"--stop", 1, "21 s\n", true},
-        {"--stop", 1, "withdraw\n12 s\n", false, true, true}};
+        {"--stop", 1, szStays, true},
+        {"--stop", 1, "withdraw\n12 s router could not be asked to take the mappings away; it may keep them\n", false,
+         true, true}};
     std::filesystem::create_directories("/tmp/t");
     for (const Case& one : rgCases) {
         std::filesystem::remove(kNames.szResultFile);
@@ -227,7 +232,7 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
     ASSERT_TRUE(parent.Take());
     std::filesystem::remove(kNames.szResultFile);
     EXPECT_EQ(InChild([] { return RunFast(PlayedMapper([](int) {}), ""); }), 1) << "a parent that starts nobody";
-    EXPECT_EQ(Read(kNames.szResultFile), "6 s\n");
+    EXPECT_EQ(Read(kNames.szResultFile), "6 s \n");
     signal(SIGHUP, SIG_DFL);
 }
 
@@ -302,13 +307,20 @@ TEST(Watch, ACrashIsFollowedByANewStartUnlessItIsTheTenth) {
             return raise(SIGKILL);
         };
         EXPECT_EQ(InChild([&, nStep = nStep] {
+                      gLog = {""};
                       gNClockStep = nStep;
                       char szTitle[] = "played --and-more";
-                      return tavo::Watch("played", szTitle).Run(fnWork);
+                      const int nAnswer = tavo::Watch("played", szTitle).Run(fnWork);
+                      Write("/tmp/t/last", gLog.back());
+                      return nAnswer;
                   }),
                   nExit)
             << szWhat;
         EXPECT_EQ(Read(kStarts).size(), nStarts) << szWhat;
+        EXPECT_EQ(Read("/tmp/t/last"), nExit == 1  ? "is not started again"
+                                       : nEnd == 1 ? ""
+                                                   : "was ended by signal 9")
+            << szWhat;
     }
 }
 
