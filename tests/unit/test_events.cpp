@@ -51,6 +51,8 @@ public:
         mRgAnswers.pop_front();
         return answer;
     }
+    void SetLimit(int nMilliseconds) override { mNLimit = nMilliseconds; }
+    void SetStop(const std::function<bool()>& fnStop) override { mBlStoppable = fnStop != nullptr; }
     void Grant(const std::vector<std::string>& rgszHeaders) { Say(200, rgszHeaders); }
     void Say(long nCode, const std::vector<std::string>& rgszHeaders = {}) {
         tavo::HttpAnswer answer{HttpEnd::kAnswered, nCode, ""};
@@ -67,6 +69,9 @@ public:
         const size_t nPath = mSzCallback.find('/', std::string("http://").size());
         return mSzCallback.substr(nPath, mSzCallback.find('>') - nPath);
     }
+
+    int mNLimit = 0;
+    bool mBlStoppable = false;
 
 private:
     std::vector<std::string> mRgszAsked;
@@ -156,11 +161,14 @@ TEST_F(EventsTest, ASubscriptionIsKeptAndEnded) {
     EXPECT_NE(mPRouter->Path(), szPath);
     mEvents.TurnTo(kService, kRouter);
     mPRouter->Grant({});
-    mEvents.Keep(mNow + 1203s, {});
+    mEvents.Keep(mNow + 1203s, [] { return false; });
+    EXPECT_TRUE(mPRouter->mBlStoppable);
     EXPECT_EQ(mPRouter->TakeAsked(), Asked{"SUBSCRIBE SID: uuid:2 TIMEOUT: Second-1800"})
         << "one that was found anew may have forgotten us";
     mEvents.End();
     EXPECT_EQ(mPRouter->TakeAsked(), Asked{"UNSUBSCRIBE SID: uuid:2"});
+    EXPECT_EQ(mPRouter->mNLimit, 1000) << "also of who is told to end, but not for long";
+    EXPECT_FALSE(mPRouter->mBlStoppable);
     EXPECT_EQ(mEvents.Fds(), std::vector<int>{-1});
     mEvents.End();
     EXPECT_EQ(mPRouter->TakeAsked(), Asked());

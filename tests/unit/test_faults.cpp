@@ -346,9 +346,6 @@ TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
     Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
     Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=0'\n");
     chmod("/usr/tavo/bin/tavoportforward", 0755);
-    const auto fnIsPacked = [] {
-        return std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.starts_with("> run /bin/tar"); });
-    };
     for (const char* szLock : {"flock", "read", "write"}) {
         gLog.clear();
         Write(kRouterConf, kOldSettings);
@@ -360,7 +357,7 @@ TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
                                                  : fcntl(fdForeign.Get(), F_OFD_SETLK, &lock),
                   0);
         CallAndDie({"", nullptr, 1, false});
-        EXPECT_EQ(fnIsPacked(), !blWrite) << szLock;
+        EXPECT_EQ(LoggedFrom("> run /bin/tar"), !blWrite) << szLock;
         CallAndDie({"settings of a newer syntax are undone", "no", 0, false});
         EXPECT_EQ(Read(kRouterConf), kOldSettings) << szLock;
         EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"})) << szLock;

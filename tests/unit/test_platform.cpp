@@ -213,6 +213,7 @@ TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
 }
 
 TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
+    EXPECT_EQ(tavo::SplitLines("a\r\nb\rc\n\r\nd"), (std::vector<std::string_view>{"a", "b\rc", "", "d"}));
     EXPECT_EQ(tavo::ParseSections("# c\r\n\r\n [a] \r\nk = plain text \nq=\"x\" # c\n")->front().rgPairs[0].szValue,
               "plain text");
     EXPECT_EQ(tavo::ParseSections("[a]\nk=\"\\x09\\x4a\\x4A\\xAf\"\n")->front().rgPairs[0].szValue, "\tJJ\xaf");

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -94,22 +95,12 @@ inline std::string Read(const std::string& szPath) {
 }
 
 inline bool Logged(const std::string& szLine) {
-    for (const std::string& szSeen : gLog) {
-        if (szSeen == szLine) {
-            return true;
-        }
-    }
-    return false;
+    return std::find(gLog.begin(), gLog.end(), szLine) != gLog.end();
 }
 
 // Whether a line begins so; numbers and places follow.
 inline bool LoggedFrom(const std::string& szBegin) {
-    for (const std::string& szSeen : gLog) {
-        if (szSeen.starts_with(szBegin)) {
-            return true;
-        }
-    }
-    return false;
+    return std::any_of(gLog.begin(), gLog.end(), [&](const auto& szSeen) { return szSeen.starts_with(szBegin); });
 }
 
 // Whether another process could take the lock now.
