@@ -32,6 +32,7 @@ constexpr char kHelp[] =
     "  --try   run the hooks and say what became of them\n"
     "  --help  this text\n";
 constexpr int kExitUsage = 2;
+constexpr int kExitFailed = 1;
 constexpr auto kHookLimit = std::chrono::seconds(30);
 constexpr auto kAfterlife = std::chrono::seconds(60);  // for what is still waiting when the daemon has ended
 
@@ -129,6 +130,32 @@ std::vector<std::string> TryFacts(std::vector<std::string> rgFacts) {
     return rgFacts;
 }
 
+bool IsFact(const std::string& szText) {
+    return szText.find('=') != std::string::npos && !szText.starts_with('=');
+}
+
+// For somebody who wants to see them run: that none was run is no success.
+int Try(const std::vector<std::string>& rgFacts) {
+    if (!std::all_of(rgFacts.begin(), rgFacts.end(), IsFact)) {
+        std::fputs(kHelp, stderr);
+        return kExitUsage;
+    }
+    if (geteuid() != 0) {
+        std::fputs("tavohook: this needs root: run it with sudo\n", stderr);
+        return kExitFailed;
+    }
+    openlog("tavohook", LOG_PERROR, LOG_DAEMON);
+    std::vector<std::string> rgszRefused;
+    if (tavo::FindHooks(tavo::kHookDirectory, rgszRefused).empty() && rgszRefused.empty()) {
+        std::fprintf(stderr,
+                     "tavohook: nothing was run: there is no hook in %s. A hook's name has letters, digits, \"_\" and "
+                     "\"-\" alone; of other files, such as README.txt or NAME.sh, none is run\n",
+                     tavo::kHookDirectory);
+        return kExitFailed;
+    }
+    return Runner().RunAll(TryFacts(rgFacts));
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -139,8 +166,7 @@ int main(int argc, char** argv) {
         return Runner().Follow();
     }
     if (szVerb == "--try") {
-        openlog("tavohook", LOG_PERROR, LOG_DAEMON);
-        return Runner().RunAll(TryFacts({argv + 2, argv + argc}));
+        return Try({argv + 2, argv + argc});
     }
     std::fputs(kHelp, szVerb == "--help" ? stdout : stderr);
     return szVerb == "--help" ? 0 : kExitUsage;

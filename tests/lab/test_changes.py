@@ -2,6 +2,7 @@
 import json
 import os
 import re
+import shutil
 import signal
 import socket
 import stat
@@ -316,6 +317,18 @@ class Hooks(unittest.TestCase):
         os.chmod(HOOKS, 0o777)
         self.assertIn(f"{HOOKS}: others than root may change it", self.try_hooks().stderr)
         self.assertEqual(len(LAB.read("/tmp/ran").splitlines()), 3)
+
+    def test_that_none_was_run_is_said(self):
+        shutil.rmtree(HOOKS, ignore_errors=True)
+        for facts, status, why in (((), 1, "there is no hook in /etc/tavo/hooks.d"), (("TAVO_PORT",), 2, "Usage"),
+                                   (("=1",), 2, "Usage")):
+            done = self.try_hooks(*facts)
+            self.assertEqual((done.returncode, why in done.stderr), (status, True), done.stderr)
+        hook("push.sh", "#!/bin/sh\n")
+        self.assertRegex(self.try_hooks().stderr, "there is no hook .*NAME.sh")
+        os.unlink(f"{HOOKS}/push.sh")
+        hook("push", "#!/bin/sh\n")
+        self.assertEqual(self.try_hooks().returncode, 0)
 
     def test_the_examples_pass_hostile_texts_on_as_texts(self):
         for program in ("/usr/local/bin/curl", "/usr/sbin/sendmail"):
