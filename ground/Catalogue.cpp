@@ -11,7 +11,7 @@ namespace {
 
 constexpr std::pair<unsigned, const char*> kCatalogue[] = {
     {TAVO_EVENT_PF_CONFLICT, "The router already uses these ports for something else: "},
-    {TAVO_EVENT_PF_ADD_FAILED, "The router refused to forward these ports: "},
+    {TAVO_EVENT_PF_ADD_FAILED, "The router has not done what was asked for these ports: "},
     {TAVO_EVENT_PF_PORT_LOST, "Lost on the router: "},
     {TAVO_EVENT_PF_PORT_REFUSED, "Refused by the router: "},
     {TAVO_EVENT_PF_PORT_BACK, "Open on the router now: "},
