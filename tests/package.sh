@@ -18,6 +18,13 @@ alive() { [ -n "$(pid "$1")" ] && kill -0 "$(pid "$1")"; }
 (umask 022 && cpack -G DEB --config "$1/CPackConfig.cmake" -B "$PWD" >cpack.log) || { cat cpack.log && exit 1; }
 for szDeb in *.deb; do
     dpkg-deb -c "$szDeb" | grep '/changelog.gz$' >/dev/null || fail "$szDeb has no changelog"
+    dpkg-deb -x "$szDeb" alone # a page of one package may not lead to another one's
+    find alone/usr/share/doc -name '*.md' | while read -r szFile; do
+        grep -oE '\]\([^):#]+' "$szFile" | sed 's/^](//' | while read -r szLink; do
+            [ -e "$(dirname "$szFile")/$szLink" ] || fail "$szFile of $szDeb links to $szLink"
+        done
+    done
+    rm -rf alone
 done
 
 # The port checker alone brings nothing else, and does not start by itself.
@@ -49,11 +56,6 @@ done
     [ -d "$szFile" ] || dpkg-query -W -f '${Conffiles}' tavoportmap | grep -q " $szFile " || echo "$szFile"
 done)" ] || fail "a file in /etc is no conffile"
 [ "$(stat -c %a /tmp/upnp_test.lock)" = 600 ] || fail "the lock files are not there"
-find /usr/share/doc/tavoportmap -name '*.md' | while read -r szFile; do
-    grep -oE '\]\([^):#]+' "$szFile" | sed 's/^](//' | while read -r szLink; do
-        [ -e "$(dirname "$szFile")/$szLink" ] || fail "$szFile links to $szLink"
-    done
-done
 tavoportmap status | grep -q '^gateway' || fail "the installed tool does not run"
 tavoportmap rules add web --router-port 443 >/dev/null
 completed() { # WORDS... : what bash offers for the last one
