@@ -45,55 +45,58 @@ struct Fate {
     bool operator==(const Fate&) const = default;
 };
 
+using Key = std::pair<std::string, int>;  // protocol and router port
+
 // Each port with the box port that it leads to; of two rules that want one port the first has it.
 struct Wanted {
-    std::map<std::pair<std::string, int>, int> mapPorts;  // by protocol and router port
-    std::map<std::pair<std::string, int>, std::string> mapDoubles;
+    std::map<Key, int> mapPorts;
+    std::vector<std::map<Key, Fate>> rgDoubles;  // what a later rule does not get, a rule each
 };
+
+std::string ToBox(int nRouter, int nBox) {
+    return nRouter == nBox ? "" : fmt::format("to port {} of this box", nBox);
+}
 
 Wanted WantedBy(const Rules& rules) {
     Wanted wanted;
-    std::map<std::pair<std::string, int>, std::string> mapOwners;
+    std::map<Key, std::string> mapOwners;
     for (const Rule& rule : rules) {
         const auto rgPairs = rule.blEnabled ? PairsOf(rule) : std::nullopt;
+        std::map<Key, Fate> mapDoubles;
         for (const PortPair& pair : rgPairs.value_or(std::vector<PortPair>())) {
-            const std::pair key(pair.szProtocol, pair.nRouter);
+            const Key key(pair.szProtocol, pair.nRouter);
             const auto [it, blNew] = wanted.mapPorts.try_emplace(key, pair.nBox);
             if (blNew) {
                 mapOwners[key] = Clean(rule.szId);
             } else if (it->second != pair.nBox) {
-                wanted.mapDoubles[key] = fmt::format(
-                    "rule {} wants it too, for another port of this box; rule {} comes "
-                    "first",
-                    Clean(rule.szId), mapOwners[key]);
+                mapDoubles[key] = {"refuse", ToBox(pair.nRouter, pair.nBox),
+                                   fmt::format("rule {} wants it too, for another port of this box; rule {} comes "
+                                               "first",
+                                               Clean(rule.szId), mapOwners[key])};
             }
         }
+        wanted.rgDoubles.push_back(std::move(mapDoubles));
     }
     return wanted;
 }
 
 // Another device that the router's table gives this port to.
-std::string Holder(const std::optional<RouterTable>& table, const std::pair<std::string, int>& key) {
+std::string Holder(const std::optional<RouterTable>& table, const Key& key) {
     const auto entry = table ? table->live.Find(key.second, key.first) : std::nullopt;
     return !entry || !entry->blEnabled || entry->szClient == table->szBox
                ? ""
                : "another device has it on the router" + WhoHas(PublishedHolder{entry->szClient, entry->szDescription});
 }
 
-Fate FateOf(const std::pair<std::string, int>& key, const Wanted& before, const Wanted& after,
-            const std::optional<RouterTable>& table) {
+Fate FateOf(const Key& key, const Wanted& before, const Wanted& after, const std::optional<RouterTable>& table) {
     const auto itBefore = before.mapPorts.find(key);
     const auto itAfter = after.mapPorts.find(key);
     if (itAfter == after.mapPorts.end()) {
         return {"close", "", ""};
     }
-    const std::string szTo =
-        itAfter->second == key.second ? "" : fmt::format("to port {} of this box", itAfter->second);
+    const std::string szTo = ToBox(key.second, itAfter->second);
     if (const std::string szHolder = Holder(table, key); !szHolder.empty()) {
         return {"refuse", szTo, szHolder};
-    }
-    if (const auto itDouble = after.mapDoubles.find(key); itDouble != after.mapDoubles.end()) {
-        return {"refuse", szTo, itDouble->second};
     }
     return {itBefore == before.mapPorts.end()     ? "open"
             : itBefore->second == itAfter->second ? "keep"
@@ -115,24 +118,32 @@ void AddLine(const std::string& szProtocol, int nFirst, int nLast, const Fate& f
 
 // Neighbours with the same fate share a line; those that lead to other ports than their own are told one by one.
 // Whether any stays out.
+bool AddLines(const std::map<Key, Fate>& mapFates, Table& text, Reply& reply) {
+    bool blRefused = false;
+    for (auto it = mapFates.begin(); it != mapFates.end();) {
+        const auto& [szProtocol, nFirst] = it->first;
+        const Fate& fate = it->second;
+        int nLast = nFirst;
+        for (++it; it != mapFates.end() && it->first == Key(szProtocol, nLast + 1) && it->second == fate; ++it) {
+            ++nLast;
+        }
+        AddLine(szProtocol, nFirst, nLast, fate, text, reply);
+        blRefused = blRefused || fate.szAction == "refuse";
+    }
+    return blRefused;
+}
+
 bool AddPorts(const Wanted& before, const Wanted& after, const std::optional<RouterTable>& table, Reply& reply) {
-    std::map<std::pair<std::string, int>, Fate> mapFates;
+    std::map<Key, Fate> mapFates;
     for (const auto* pWanted : {&before, &after}) {
         for (const auto& [key, nBox] : pWanted->mapPorts) {
             mapFates.try_emplace(key, FateOf(key, before, after, table));
         }
     }
-    bool blRefused = false;
     Table text({"would", "port", ""});
-    for (auto it = mapFates.begin(); it != mapFates.end();) {
-        const auto& [szProtocol, nFirst] = it->first;
-        const Fate& fate = it->second;
-        int nLast = nFirst;
-        for (++it; it != mapFates.end() && it->first == std::pair(szProtocol, nLast + 1) && it->second == fate; ++it) {
-            ++nLast;
-        }
-        AddLine(szProtocol, nFirst, nLast, fate, text, reply);
-        blRefused = blRefused || fate.szAction == "refuse";
+    bool blRefused = AddLines(mapFates, text, reply);
+    for (const auto& mapDoubles : after.rgDoubles) {
+        blRefused = AddLines(mapDoubles, text, reply) || blRefused;
     }
     reply.szBody += text.ToText();
     return blRefused;

@@ -47,8 +47,11 @@ Reply Save(bool blJson) {
 
 Reply DryRun() {
     const auto inForce = LoadRules();
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
     const auto rules = LoadDraft();
-    return inForce && rules ? DryRunOf(*inForce, *rules) : NeedsRoot().value_or(Unreadable());
+    return inForce && rules ? DryRunOf(*inForce, *rules) : Unreadable();
 }
 
 }  // namespace

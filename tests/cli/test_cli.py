@@ -392,11 +392,11 @@ class Tool(unittest.TestCase):
         code, told = self.json("save", "--dry-run", **world)
         self.assertEqual((code, told["table_read"]), (REFUSED, True))
         self.assertEqual({(port["action"], port["router_ports"], port["protocol"]) for port in told["ports"]},
-                         {("keep", "80", "tcp"), ("refuse", "81", "tcp"), ("close", "53", "udp"), ("open", "6000-6002", "udp"),
+                         {("keep", "80", "tcp"), ("change", "81", "tcp"), ("refuse", "81", "tcp"), ("close", "53", "udp"), ("open", "6000-6002", "udp"),
                           ("refuse", "90", "tcp"), ("refuse", "5000", "tcp")})
         self.assertEqual({port["router_ports"] for port in told["ports"] if port["why"]}, {"81", "90", "5000"})
         self.expect("save --dry-run", REFUSED, r"refuse +90/tcp +another device has it on the router \(192.168.77.99, console\\x1b", **world)
-        self.expect("save --dry-run", REFUSED, r"refuse +81/tcp +to port 8081 of this box: rule \d+ wants it too", **world)
+        self.expect("save --dry-run", REFUSED, r"change +81/tcp +to port 8081 of this box\n(?s:.)*refuse +81/tcp +rule \d+ wants it too", **world)
         tool("rules", "add", "--router-port", "91")
         self.expect("save --dry-run", TOO_MANY, "holds 5 rules and there are 6", **world)
         self.assertEqual(len(self.in_force()), 3)
