@@ -37,7 +37,7 @@ Reply NoGateway() {
     return {.enExit = kFailed,
             .szMessage =
                 "this box has no default gateway, so there is no router to talk to: plug the cable in or see to the "
-                "network settings ('ip route' shows the routes), then run 'tavoportmap setup'"};
+                "network settings ('ip route' shows the routes), then run 'sudo tavoportmap setup'"};
 }
 
 std::optional<Reply> NeedsRoot() {

@@ -21,7 +21,7 @@ constexpr char kUnnoted[] =
     "what to switch on again could not be noted in /etc/portforward; is the disk full or read-only? Nothing was "
     "changed";
 
-constexpr char kOffAlready[] = "every port is switched off already; 'tavoportmap on' opens them again";
+constexpr char kOffAlready[] = "every port is switched off already; 'sudo tavoportmap on' opens them again";
 
 // Has fnChange change the rules in force and saves them. fnChange answers what there is to say when nothing is to be
 // saved; fnDone completes the reply to a save whose rules are in rule.conf.
@@ -129,8 +129,8 @@ std::string OthersOf(const Rules& rules, const Meaning& meaning) {
         std::vector<PortPair> rgMeant = rgPairs.value_or(std::vector<PortPair>());
         std::erase_if(rgMeant, [&](const PortPair& pair) { return !meaning.Has(pair); });
         if (!rgMeant.empty()) {
-            rgszOthers.push_back(fmt::format("Rule {} forwards {}; 'tavoportmap close {}' closes that", NameOf(rule),
-                                             Text(rgMeant), Text(rgMeant, " ")));
+            rgszOthers.push_back(fmt::format("Rule {} forwards {}; 'sudo tavoportmap close {}' closes that",
+                                             NameOf(rule), Text(rgMeant), Text(rgMeant, " ")));
         }
     }
     return fmt::format("{}", fmt::join(rgszOthers, "\n"));
@@ -158,10 +158,11 @@ std::optional<Reply> Understand(const Rules& rules, const std::vector<std::strin
         }
         const auto meaning = Meant(rules, szWord);
         if (!meaning) {
-            return Reply{.enExit = kUsage,
-                         .szMessage = fmt::format("'{}' is neither a port nor the name of a rule; 'tavoportmap rules "
-                                                  "list' shows them",
-                                                  Clean(szWord))};
+            return Reply{
+                .enExit = kUsage,
+                .szMessage = fmt::format("'{}' is neither a port nor the name of a rule; 'sudo tavoportmap rules "
+                                         "list' shows them",
+                                         Clean(szWord))};
         }
         const std::string szOthers = OthersOf(rules, *meaning);
         Rules left = rules;
@@ -230,9 +231,9 @@ private:
 void Describe(const std::vector<PortPair>& rgClosed, const Waiting& waiting, Reply& reply) {
     const std::string szClosed = Text(rgClosed);
     if (reply.enExit == kOk && waiting.IsAny()) {
-        reply.szMessage = fmt::format(
-            "every port was switched off already; {} will not be opened again by 'tavoportmap on', {}", szClosed,
-            waiting.Left() > 0 ? "which brings back the others" : "and no other one waits for it");
+        reply.szMessage =
+            fmt::format("every port was switched off already; {} will not be opened again by 'on', {}", szClosed,
+                        waiting.Left() > 0 ? "which brings back the others" : "and no other one waits for it");
     } else if (reply.enExit == kOk) {
         reply.szMessage = fmt::format("{} closed; {}", szClosed, reply.szMessage);
     } else if (IsRouterAway(reply)) {
@@ -312,12 +313,14 @@ Reply Off(bool blJson) {
     Reply reply = Change(blJson, fnChange, [&](Reply& done) {
         blStored = true;
         if (done.enExit == kOk) {
-            done.szMessage = blAlready ? kOffAlready
-                                       : "every port is closed, and the rules are kept; 'tavoportmap on' opens them "
-                                         "again";
+            done.szMessage = blAlready
+                                 ? kOffAlready
+                                 : "every port is closed, and the rules are kept; 'sudo tavoportmap on' opens them "
+                                   "again";
         } else if (IsRouterAway(done)) {
             done.szMessage =
-                "every port is switched off on this box, not yet on the router; 'tavoportmap on' opens them again\n" +
+                "every port is switched off on this box, not yet on the router; 'sudo tavoportmap on' opens them "
+                "again\n" +
                 done.szMessage;
         }
     });
@@ -339,7 +342,7 @@ Reply On(bool blJson) {
         }
         if (enState == ReadState::kAbsent) {
             DropOff();
-            return Reply{.szMessage = "nothing to switch on: no rule in force is one that 'tavoportmap off' closed"};
+            return Reply{.szMessage = "nothing to switch on: no rule in force is one that 'off' closed"};
         }
         SwitchOn(rules, before);
         return std::nullopt;
@@ -361,10 +364,10 @@ void OfferClose(CLI::App& app, Request& request) {
     pClose->callback(
         [pWords, &request] { request.fnCommand = [pWords, &request] { return ClosePorts(*pWords, request.blJson); }; });
     CLI::App* pOff = AddCommand(app, "off", "close every port of this box on the router, and keep the rules");
-    pOff->footer("It stays so, whatever a service asks for, until 'tavoportmap on'.\n");
+    pOff->footer("It stays so, whatever a service asks for, until 'sudo tavoportmap on'.\n");
     pOff->callback([&request] { request.fnCommand = [&request] { return Off(request.blJson); }; });
     CLI::App* pOn = AddCommand(app, "on", "open again what 'off' has closed");
-    pOn->footer("Opens no rule that was switched off before 'off'; 'tavoportmap rules enable' and 'save' do.\n");
+    pOn->footer("Opens no rule that was switched off before 'off'; 'sudo tavoportmap rules enable' and 'save' do.\n");
     pOn->callback([&request] { request.fnCommand = [&request] { return On(request.blJson); }; });
 }
 

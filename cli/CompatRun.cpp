@@ -76,7 +76,8 @@ Reply NotRun(const TestRun& run) {
             return Busy();
         case TAVO_ROUTER_STATUS_NO_GATEWAY:
             return Failure(
-                "no router answered that speaks UPnP and says what it is; nothing was changed. 'tavoportmap setup' "
+                "no router answered that speaks UPnP and says what it is; nothing was changed. 'sudo tavoportmap "
+                "setup' "
                 "looks "
                 "for the other ways there are");
         default:
@@ -86,7 +87,7 @@ Reply NotRun(const TestRun& run) {
 
 std::string AfterFailure() {
     return fmt::format("More of it stands in /var/log/router.log{}",
-                       CanBeReported() ? "; 'tavoportmap report' sends it to the report server" : "");
+                       CanBeReported() ? "; 'sudo tavoportmap report' sends it to the report server" : "");
 }
 
 std::string RecordEffect(const TestRun& run) {

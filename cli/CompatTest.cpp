@@ -44,7 +44,7 @@ Reply Stopped(bool blEnded) {
 
 Reply AlreadyTesting() {
     return {.enExit = kBusy,
-            .szMessage = "a compatibility test is running already; 'tavoportmap compat --stop' would end it"};
+            .szMessage = "a compatibility test is running already; 'sudo tavoportmap compat --stop' would end it"};
 }
 
 StopOnSignal::StopOnSignal(bool blJson, std::function<void()> fnPark)

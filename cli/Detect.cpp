@@ -27,14 +27,15 @@ std::string NextStep(const Detected& detected) {
     const Finding enFinding = FindingOf(detected);
     switch (enFinding) {
         case Finding::kKnown:
-            return "'tavoportmap detect --last --save' stores this as the router's settings";
+            return "'sudo tavoportmap detect --last --save' stores this as the router's settings";
         case Finding::kNoRouter:
             return FindingWords(enFinding, detected);
         case Finding::kNeither:
         case Finding::kRefusesNatpmp:
-            return FindingWords(enFinding, detected) + ", then run 'tavoportmap setup'. " + kManualWay;
+            return FindingWords(enFinding, detected) + ", then run 'sudo tavoportmap setup'. " + kManualWay;
         default:
-            return FindingWords(enFinding, detected) + "; 'tavoportmap setup' finds a way to drive it and stores that";
+            return FindingWords(enFinding, detected) +
+                   "; 'sudo tavoportmap setup' finds a way to drive it and stores that";
     }
 }
 

@@ -17,8 +17,8 @@ namespace {
 constexpr Step kSteps[] = {
     {10, "preparing", "what was known of the router could not be cleared; the system log says why"},
     {20, "looking at the network interface",
-     "no network interface is up and has an address: plug the cable in, or see to the Wi-Fi, then run 'tavoportmap "
-     "setup'"},
+     "no network interface is up and has an address: plug the cable in, or see to the Wi-Fi, then run 'sudo "
+     "tavoportmap setup'"},
     {30, "looking at the gateway setting", "the gateway setting could not be read"},
     {40, "trying to reach the Internet", "the Internet cannot be reached"},
     {70, "counting the routers on the way to the Internet", "the way to the Internet could not be looked at"},
@@ -66,7 +66,7 @@ std::string Pages(const Detected& detected) {
 const char kManualWay[] =
     "Where it has neither, it can be driven through its own pages when its model is described:\n"
     "  tavoportmap routers BRAND    shows the models that are\n"
-    "  tavoportmap router set --brand BRAND --model MODEL --version VERSION \\\n"
+    "  sudo tavoportmap router set --brand BRAND --model MODEL --version VERSION \\\n"
     "      --upnp no --natpmp no --user NAME --conn-type http --conn-port 80";
 
 bool Detected::IsKnown() const {
@@ -107,17 +107,17 @@ Reply FailedDetection(const Detected& detected) {
                     .szMessage =
                         detected.word.nThere == 0
                             ? fmt::format("the router {} does not answer at all: is it switched on, and is the cable "
-                                          "to it plugged in? See to it, then run 'tavoportmap setup'",
+                                          "to it plugged in? See to it, then run 'sudo tavoportmap setup'",
                                           Clean(detected.szGateway))
                             : fmt::format("the router {} is there, but the Internet cannot be reached through it: see "
                                           "to its own connection (modem, cable, provider; its pages are at {}), then "
-                                          "run 'tavoportmap setup'",
+                                          "run 'sudo tavoportmap setup'",
                                           Clean(detected.szGateway), Pages(detected))};
         case TAVO_LIBTAVOPORTMAP_ERR_DNS:
             return {.enExit = kFailed,
                     .szMessage =
                         "names cannot be resolved: see to the name servers in /etc/resolv.conf or in the "
-                        "router's settings, then run 'tavoportmap setup'"};
+                        "router's settings, then run 'sudo tavoportmap setup'"};
         default:
             return Failure(StepAt(kSteps, detected.result.nProgress).szFailed);
     }

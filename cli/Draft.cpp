@@ -307,10 +307,11 @@ bool DropDraft() {
 }
 
 Reply Unreadable() {
-    return Failure(LoadRules() ? fmt::format("the edits that are not saved yet cannot be read ({}); 'tavoportmap rules "
-                                             "discard' drops them, and the rules in force stay as they are",
-                                             kDraft)
-                               : kUnreadable);
+    return Failure(LoadRules()
+                       ? fmt::format("the edits that are not saved yet cannot be read ({}); 'sudo tavoportmap rules "
+                                     "discard' drops them, and the rules in force stay as they are",
+                                     kDraft)
+                       : kUnreadable);
 }
 
 // ---- off ---------------------------------------------------------------------------------------------------

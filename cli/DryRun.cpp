@@ -179,7 +179,7 @@ Reply DryRunOf(const Rules& inForce, const Rules& rules) {
     }
     reply.enExit = blRefused ? kRefused : kOk;
     reply.szMessage = blRefused ? "some ports would stay out; nothing was changed"
-                                : "this is what 'tavoportmap save' would do; nothing was changed";
+                                : "this is what 'sudo tavoportmap save' would do; nothing was changed";
     return reply;
 }
 

@@ -130,13 +130,13 @@ void OfferListeners(const std::string& szGateway, bool blAsk, Reply& reply) {
     }
     if (rgFound.empty()) {
         reply.szMessage +=
-            "\nno program here waits for connections that is not forwarded yet; 'tavoportmap open PORT' "
+            "\nno program here waits for connections that is not forwarded yet; 'sudo tavoportmap open PORT' "
             "opens a port for one that is still to come";
         return;
     }
     reply.szBody += "\nlistens on this box and is not forwarded:\n" + table.ToText();
     if (!blAsk) {
-        reply.szMessage += fmt::format("\n'tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
+        reply.szMessage += fmt::format("\n'sudo tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
                                        szSafe.empty() ? "a port" : "the first of them that is fit for it");
         return;
     }

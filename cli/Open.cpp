@@ -98,7 +98,7 @@ Reply SaveOpening(const Rule& rule, bool& blAlready, bool blJson) {
     }
     if (IsOff()) {
         return {.enExit = kFailed,
-                .szMessage = "every port is switched off, and nothing was changed; 'tavoportmap on' comes first"};
+                .szMessage = "every port is switched off, and nothing was changed; 'sudo tavoportmap on' comes first"};
     }
     const Opening opening = Open(*rules, rule);
     if (!opening.szFault.empty()) {
@@ -276,8 +276,8 @@ void OfferOpen(CLI::App& app, Request& request) {
     pOpen->add_flag("--yes", pWish->blYes, "ask nothing, and open also what should not face the world");
     pOpen->footer(
         "Finds out what the router is when that is not known yet, opens the port there and looks at who answers. Edits "
-        "by 'rules' that are not saved stay so. 'tavoportmap close' takes it back.\n"
-        "Example: tavoportmap open 443 --to 8443 --name web\n");
+        "by 'rules' that are not saved stay so. 'sudo tavoportmap close' takes it back.\n"
+        "Example: sudo tavoportmap open 443 --to 8443 --name web\n");
     pOpen->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return OpenPorts(*pWish, request.blJson); }; });
 }

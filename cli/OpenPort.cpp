@@ -40,7 +40,7 @@ Opening Open(const Rules& rules, const Rule& wanted) {
         const auto it = mapOwners.find(pair.Name());
         if (it != mapOwners.end() && it->second.nBox != pair.nBox) {
             return {.szFault = fmt::format("router port {} leads to port {} of this box already, by rule {}; "
-                                           "'tavoportmap close {}' takes it away first",
+                                           "'sudo tavoportmap close {}' takes it away first",
                                            pair.Name(), it->second.nBox, NameOf(*it->second.pRule), pair.Name()),
                     .rules = rules};
         }

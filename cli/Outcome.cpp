@@ -28,9 +28,9 @@ constexpr Cause kCauses[] = {
     {"unreachable", "the router {} cannot be reached", "look at its power and at the cable, or at the Wi-Fi"},
     {"no_gateway", "this box has no default gateway any more", "'ip route' shows the routes; is the cable plugged in?"},
     {"no_upnp", "the router {} is there, but does not offer UPnP",
-     "switch UPnP on in its own pages (http://{}/), or 'tavoportmap setup' looks for another way"},
+     "switch UPnP on in its own pages (http://{}/), or 'sudo tavoportmap setup' looks for another way"},
     {"no_natpmp", "the router {} is there, but does not offer NAT-PMP",
-     "switch it on in its own pages (http://{}/), or 'tavoportmap setup' looks for another way"},
+     "switch it on in its own pages (http://{}/), or 'sudo tavoportmap setup' looks for another way"},
     {"silent", "the router {} does not answer", "often it helps to restart the router"},
 };
 
@@ -100,7 +100,7 @@ const char* Remedy(const Published& published) {
         return "'sudo tavoportmap router set --ask-password' stores another password, and '--user' another name";
     }
     if (published.szProtocol == "pages" && !published.szRouterWhy.empty()) {
-        return "'sudo journalctl -t tavoportforward' says more; 'tavoportmap save' tries again";
+        return "'sudo journalctl -t tavoportforward' says more; 'sudo tavoportmap save' tries again";
     }
     // A router that maps each port of the box but once; another router port would not help.
     const auto nShared = static_cast<size_t>(
@@ -108,11 +108,12 @@ const char* Remedy(const Published& published) {
             return rule.enState != PortState::kOpen && rule.szWhy.starts_with("another rule has this port of the box");
         }));
     if (nShared == 0) {
-        return "Choose other router ports ('tavoportmap rules edit'), or free them there";
+        return "Choose other router ports ('sudo tavoportmap rules edit'), or free them there";
     }
     return nShared == NotOpen(published)
-               ? "Choose another port of this box ('tavoportmap rules edit RULE --box-port PORT')"
-               : "Choose other router ports ('tavoportmap rules edit') or free them there, and another port of this "
+               ? "Choose another port of this box ('sudo tavoportmap rules edit RULE --box-port PORT')"
+               : "Choose other router ports ('sudo tavoportmap rules edit') or free them there, and another port of "
+                 "this "
                  "box where another rule has it";
 }
 
@@ -185,8 +186,8 @@ Reply OutcomeOf(const Published& published, const Rules& rules, const std::strin
         nNot > 0    ? fmt::format("{} not open on the router; {}. {}", Count(nNot, "port"), szOthers, Remedy(published))
         : nLeft > 0 ? fmt::format("{} could not be taken away from the router yet; {}", Count(nLeft, "port"),
                                   published.szProtocol != "pages" ? "the daemon goes on trying"
-                                  : IsOff()                       ? "'tavoportmap off' tries again"
-                                                                  : "the next 'tavoportmap save' tries again")
+                                  : IsOff()                       ? "'sudo tavoportmap off' tries again"
+                                                                  : "the next 'sudo tavoportmap save' tries again")
         : nOn == 0  ? fmt::format("no rule is switched on; the router {} keeps none of ours", szGateway)
                     : fmt::format("{} in force on the router {}", Count(nOn, "rule"), szGateway);
     return reply;

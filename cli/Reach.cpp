@@ -15,8 +15,8 @@ namespace {
 enum Status : int { kNotTested = 0, kDisabled = 1, kOpen = 2, kClosed = 3 };
 
 constexpr char kAdviceClosed[] =
-    "closed from outside: have the rules been written ('tavoportmap save')? Then it is another router on the way "
-    "('tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
+    "closed from outside: have the rules been written ('sudo tavoportmap save')? Then it is another router on the way "
+    "('sudo tavoportmap detect' warns of it), a firewall, or a provider who blocks the port";
 constexpr size_t kUrlSize = 1024;
 constexpr std::string_view kNotTestedSaid = "not tested: ";
 constexpr char kAdviceNoChecker[] =

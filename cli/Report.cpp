@@ -65,12 +65,13 @@ std::string WhyNotMade() {
     DetectResult detected = {};
     TLibGetRouterDetectResult(&detected);
     if (*detected.szBrand == '\0' && *detected.szModel == '\0') {
-        return "a report says which router it is about, and none has been found yet: 'tavoportmap detect' looks for it";
+        return "a report says which router it is about, and none has been found yet: 'sudo tavoportmap detect' looks "
+               "for it";
     }
     if (!CanBeReported()) {
         return fmt::format(
             "a report is about a router that a database or a test knows to work with UPnP or NAT-PMP, which this one "
-            "is not by the last detection ('tavoportmap detect' makes another). The files of its last test are {}",
+            "is not by the last detection ('sudo tavoportmap detect' makes another). The files of its last test are {}",
             fmt::join(kTestFiles, ", "));
     }
     return "its files could not be packed; the system log says why";
@@ -80,9 +81,10 @@ std::string WhyNotMade() {
 std::string WhyNotSent(const std::string& szMissing, const std::string& szArchive) {
     const bool blServer = *GetUPnPReportServer() != '\0';
     const std::string szCause =
-        !szMissing.empty() ? fmt::format("the last test did not leave {}; 'tavoportmap compat' runs one", szMissing)
-        : blServer         ? "the server, which is named in [report] of /etc/tavo/platform.conf, did not take it"
-                           : "no server is named to send it to (server in [report] of /etc/tavo/platform.conf)";
+        !szMissing.empty()
+            ? fmt::format("the last test did not leave {}; 'sudo tavoportmap compat' runs one", szMissing)
+        : blServer ? "the server, which is named in [report] of /etc/tavo/platform.conf, did not take it"
+                   : "no server is named to send it to (server in [report] of /etc/tavo/platform.conf)";
     return fmt::format("{}. What there is stays in {}", szCause, Clean(szArchive));
 }
 

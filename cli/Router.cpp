@@ -67,13 +67,13 @@ Reply Show(bool blShowPassword) {
         const std::string szOther = OtherGateway(settings.szGateway);
         reply.jsAnswer["other_gateway"] = szOther.empty() ? Json::Value() : Json::Value(szOther);
         reply.szMessage =
-            fmt::format("nothing is stored for the router {} yet{}; 'tavoportmap setup' finds out what it is",
+            fmt::format("nothing is stored for the router {} yet{}; 'sudo tavoportmap setup' finds out what it is",
                         settings.szGateway, szOther.empty() ? "" : ", only for another one (" + Clean(szOther) + ")");
         return reply;
     }
     if (settings.enFound == Found::kWithoutLimit) {
         reply.rgszWarnings.emplace_back(
-            "nobody has recorded how many rules this router holds, so no rules can be saved; 'tavoportmap router "
+            "nobody has recorded how many rules this router holds, so no rules can be saved; 'sudo tavoportmap router "
             "set --max-rules 0' records that no limit is known, another number how many there are");
     }
     reply.jsAnswer["router"] = ToJson(settings.conf, blShowPassword);
@@ -144,8 +144,8 @@ Reply Set(const Wish& wish) {
         return {.enExit = kUsage,
                 .szMessage =
                     "nothing to set; for example\n"
-                    "  tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
-                    "  tavoportmap router set --user admin --conn-type http --conn-port 80\n"
+                    "  sudo tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
+                    "  sudo tavoportmap router set --user admin --conn-type http --conn-port 80\n"
                     "'tavoportmap router set --help' explains"};
     }
     Settings settings = ReadSettings();
@@ -203,8 +203,8 @@ void OfferSet(CLI::App& router, Request& request) {
         "needs both, and a description ('tavoportmap routers'). The account is kept for the day when UPnP or NAT-PMP "
         "is switched off again.\n"
         "Examples:\n"
-        "  tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
-        "  tavoportmap router set --user admin --conn-type http --conn-port 80\n");
+        "  sudo tavoportmap router set --brand Acme --model R1 --upnp yes --max-rules 32\n"
+        "  sudo tavoportmap router set --user admin --conn-type http --conn-port 80\n");
     pSet->callback([pWish, &request] { request.fnCommand = [pWish] { return Set(*pWish); }; });
 }
 

@@ -168,7 +168,7 @@ Choice Choose(const Rules& rules, const std::string& szWhich) {
         if (!rgFound.empty() &&
             ParsePorts(rules[rgFound.front()].szRouterPorts)->size() > ParsePorts(wish->szPorts)->size()) {
             return {.szFault = fmt::format("rule {} forwards more than '{}': name it by its id to change all of it, or "
-                                           "'tavoportmap close {}' closes that port alone",
+                                           "'sudo tavoportmap close {}' closes that port alone",
                                            Clean(rules[rgFound.front()].szId), Clean(szWhich), Clean(szWhich))};
         }
     }

@@ -109,7 +109,7 @@ std::string TooLong(const Rules& rules) {
             std::max({rule.szId.size(), rule.szProtocol.size(), rule.szServiceId.size(), rule.szName.size()});
         if (blPorts || nText >= TAVO_TEXT_SIZE) {
             return fmt::format(
-                "{} of rule {} is longer than {} bytes and would be cut: 'tavoportmap rules list' shows it, {}. "
+                "{} of rule {} is longer than {} bytes and would be cut: 'sudo tavoportmap rules list' shows it, {}. "
                 "Nothing was changed",
                 blPorts ? "a port list" : "a name", Clean(rule.szId), blPorts ? kMostPortText : TAVO_TEXT_SIZE - 1,
                 blPorts ? "'rules edit' makes it shorter and 'rules add' takes the rest" : "'rules edit' changes it");

@@ -272,7 +272,7 @@ void OfferAdd(CLI::App& rules, Request& request) {
         ->type_name("WORD");
     pAdd->add_flag("--disabled", pNew->blDisabled, "note it switched off");
     pAdd->add_flag("--force", pNew->blForce, "also when another rule wants the same router port");
-    pAdd->footer("Example: tavoportmap rules add web --router-port 443 --box-port 8443\n");
+    pAdd->footer("Example: sudo tavoportmap rules add web --router-port 443 --box-port 8443\n");
     pAdd->callback([pNew, &request] {
         request.fnCommand = [pNew] {
             Rule rule = pNew->rule;
@@ -332,13 +332,14 @@ void OfferEdit(CLI::App& rules, Request& request) {
         ->check(OneOf({"tcp", "udp", "all"}))
         ->type_name("WORD");
     pVerb->add_flag("--force", pEdit->blForce, "also when another rule wants the same router port");
-    pVerb->footer("Example: tavoportmap rules edit web --box-port 9443\n");
+    pVerb->footer("Example: sudo tavoportmap rules edit web --box-port 9443\n");
     pVerb->callback([pEdit, &request] {
         request.fnCommand = [pEdit]() -> Reply {
             if (!pEdit->Says("--name") && !pEdit->Says("--router-port") && !pEdit->Says("--box-port") &&
                 !pEdit->Says("--protocol")) {
-                return {.enExit = kUsage,
-                        .szMessage = "nothing to change; for example\n  tavoportmap rules edit web --box-port 9443"};
+                return {
+                    .enExit = kUsage,
+                    .szMessage = "nothing to change; for example\n  sudo tavoportmap rules edit web --box-port 9443"};
             }
             return ChangeRule(
                 pEdit->szWhich, pEdit->blForce, [pEdit](Rule& rule) { return Apply(*pEdit, rule); }, false);
@@ -371,8 +372,8 @@ void OfferRules(CLI::App& app, Request& request) {
     CLI::App* pRules = AddCommand(app, "rules", "the rules: list, add, remove, enable, disable, edit, import, export");
     pRules->require_subcommand(1);
     pRules->footer(
-        "An edit stands aside until 'tavoportmap save' writes the rules to the router; 'rules discard' drops it. "
-        "'tavoportmap open' and 'close' do it all at once for a port.\n");
+        "An edit stands aside until 'sudo tavoportmap save' writes the rules to the router; 'rules discard' drops it. "
+        "'sudo tavoportmap open' and 'close' do it all at once for a port.\n");
     AddCommand(*pRules, "list", "show the rules, what is not saved yet and which of them want the same port")
         ->callback([&request] { request.fnCommand = &ListRules; });
     OfferAdd(*pRules, request);

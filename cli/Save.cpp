@@ -29,10 +29,11 @@ Reply Save(bool blJson) {
     }
     const bool blDraft = HasDraft();
     if (IsOff()) {
-        return {.enExit = kFailed,
-                .szMessage = fmt::format("every port is switched off, and nothing was saved{}; 'tavoportmap on' opens "
-                                         "them again",
-                                         blDraft ? " (the edits stay noted)" : "")};
+        return {
+            .enExit = kFailed,
+            .szMessage = fmt::format("every port is switched off, and nothing was saved{}; 'sudo tavoportmap on' opens "
+                                     "them again",
+                                     blDraft ? " (the edits stay noted)" : "")};
     }
     Reply reply = SaveRules(*rules, blJson);
     const bool blStored = AreStored(*rules);
@@ -40,16 +41,16 @@ Reply Save(bool blJson) {
         DropDraft();
         DropOff();  // of ports that somebody has opened in another way
     } else if (blDraft && reply.enExit != kOk) {
-        reply.szMessage += "\nThe edits stay noted: 'tavoportmap rules list' shows them";
+        reply.szMessage += "\nThe edits stay noted: 'sudo tavoportmap rules list' shows them";
     }
     return reply;
 }
 
 Reply DryRun() {
-    const auto inForce = LoadRules();
     if (const auto reply = NeedsRoot()) {
         return *reply;
     }
+    const auto inForce = LoadRules();
     const auto rules = LoadDraft();
     return inForce && rules ? DryRunOf(*inForce, *rules) : Unreadable();
 }

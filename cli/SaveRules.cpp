@@ -33,7 +33,7 @@ constexpr auto kHandOver = std::chrono::seconds(5);
 constexpr auto kTakenAway = std::chrono::seconds(60);
 constexpr char kChanged[] =
     "somebody else has changed /etc/portforward/rule.conf meanwhile: the next save goes by what stands there now "
-    "('tavoportmap rules list')";
+    "('sudo tavoportmap rules list')";
 
 std::string StepAt(int nPercent) {
     switch (nPercent) {
@@ -112,7 +112,8 @@ std::string WhyRefused(const SaveResult& result, Way enWay) {
 // Why the rules do not fit the router. Nothing has been changed then.
 std::string WhyTooMany(const SaveResult& result, size_t nRules) {
     const std::string szHint =
-        "\nNothing was changed; 'tavoportmap rules list' shows the rules: remove some, or 'rules discard' the edits";
+        "\nNothing was changed; 'sudo tavoportmap rules list' shows the rules: remove some, or 'rules discard' the "
+        "edits";
     switch (result.nStatus) {
         case TAVO_ROUTER_STATUS_TOO_MANY_RULES:
             return fmt::format("the router holds {} and there are {}", Count(result.nLimit, "rule"), nRules) + szHint;
@@ -237,7 +238,7 @@ int GoOn(bool blJson, Progress& progress) {
     return Print({.enExit = kFailed,
                   .szMessage = blHanded ? "the waiting is ended, not the save: the rules are stored, and the daemon "
                                           "brings them to the router; 'tavoportmap status' shows what comes of it"
-                                        : "the save is ended; 'tavoportmap rules list' shows what is in force"},
+                                        : "the save is ended; 'sudo tavoportmap rules list' shows what is in force"},
                  blJson);
 }
 

@@ -234,7 +234,8 @@ Reply NotSet(const Surroundings& found, const std::string& szLog, time_t nStart)
     }
     if (!IsStored(found.plan.after)) {
         return Failure(
-            "the request failed, and the rules are as they were; 'tavoportmap service plan' shows what it meets, and "
+            "the request failed, and the rules are as they were; 'sudo tavoportmap service plan' shows what it meets, "
+            "and "
             "the "
             "system log says why");
     }
@@ -242,7 +243,7 @@ Reply NotSet(const Surroundings& found, const std::string& szLog, time_t nStart)
     Reply reply = published ? OutcomeOf(*published, found.plan.after, published->szGateway)
                             : Failure(
                                   "the rules are stored, but the router did not take them all, or its daemon did not "
-                                  "answer; 'tavoportmap save' tries again and says which");
+                                  "answer; 'sudo tavoportmap save' tries again and says which");
     reply.enExit = reply.enExit == kOk ? kFailed : reply.enExit;
     return reply;
 }
@@ -269,7 +270,7 @@ Reply SetDone(const Wish& wish, const Surroundings& found, const std::string& sz
     if (!found.plan.szRefusal.empty() || !IsStored(found.plan.after)) {
         reply.szBody.clear();
         reply.szMessage =
-            "the request is in force, but others changed the rules meanwhile; 'tavoportmap service list' "
+            "the request is in force, but others changed the rules meanwhile; 'sudo tavoportmap service list' "
             "shows what came of it";
         return reply;
     }
@@ -385,7 +386,7 @@ Reply List() {
         reply.jsAnswer["rules"].append(ToJson(rule));
     }
     reply.szBody = table.ToText();
-    reply.szMessage = rules->empty() ? "no rule belongs to a service; 'tavoportmap service set' makes some" : "";
+    reply.szMessage = rules->empty() ? "no rule belongs to a service; 'sudo tavoportmap service set' makes some" : "";
     return reply;
 }
 
@@ -419,8 +420,9 @@ Reply Detect(bool blJson) {
     Reply reply =
         nResult == 0   ? Reply{.szMessage = "the router takes ports by UPnP or NAT-PMP; a service can have some"}
         : nResult == 1 ? Reply{.szMessage = "the router is driven through its own pages; no service gets ports on it"}
-        : nResult == 2 ? Busy()
-                       : Failure("the router could not be classified; 'tavoportmap detect' says which step failed");
+        : nResult == 2
+            ? Busy()
+            : Failure("the router could not be classified; 'sudo tavoportmap detect' says which step failed");
     reply.jsAnswer["result"] = nResult;
     reply.jsAnswer["kind"] = nResult == 0 || nResult == 1 ? Json::Value(kKinds[nResult]) : Json::Value();
     return reply;
@@ -457,7 +459,7 @@ void OfferService(CLI::App& app, Request& request) {
     pService->footer(
         "A service's request takes the place of its rules. The user's rules win over it, so do other hosts' mappings "
         "on a UPnP router, and a rule of the service that is switched off.\n"
-        "Example: tavoportmap service set hoplink 5000-5001/tcp 6000/udp --test\n");
+        "Example: sudo tavoportmap service set hoplink 5000-5001/tcp 6000/udp --test\n");
     OfferRequest(*pService, request, "set", "have exactly these ports open for a service", true, &Set);
     OfferRequest(*pService, request, "plan", "what that would come to, port by port; changes nothing", true,
                  [](const Wish& wish, bool) { return Plan(wish); });

@@ -17,7 +17,8 @@ constexpr char kConfFile[] = "/etc/portforward/router.conf";
 constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
 
 constexpr char kManualRouter[] =
-    "this router is driven through its own pages, where a service's ports are never written; 'tavoportmap open PORT' "
+    "this router is driven through its own pages, where a service's ports are never written; 'sudo tavoportmap open "
+    "PORT' "
     "forwards one by a rule of yours";
 
 Found Look(const std::string& szGateway, RouterConf& conf, bool blLock) {
@@ -44,10 +45,10 @@ std::optional<Reply> Obstacle(Found enFound) {
     if (enFound != Found::kFailed) {
         return std::nullopt;
     }
-    return Failure(
-        fmt::format("{} cannot be read as settings; it was left as it is. 'tavoportmap setup' puts it aside and starts "
-                    "anew",
-                    kConfFile));
+    return Failure(fmt::format(
+        "{} cannot be read as settings; it was left as it is. 'sudo tavoportmap setup' puts it aside and starts "
+        "anew",
+        kConfFile));
 }
 
 __TAG_TAVO_ROUTER_INIT_STATE CachedState(const std::string& szGateway) {
@@ -85,7 +86,7 @@ __TAG_TAVO_ROUTER_INIT_STATE StateOf(const Settings& settings) {
 
 }  // namespace
 
-const char kNotDetected[] = "the router has not been detected yet: 'tavoportmap service detect' comes first";
+const char kNotDetected[] = "the router has not been detected yet: 'sudo tavoportmap service detect' comes first";
 
 bool AreUnreadable(const std::string& szGateway) {
     std::error_code error;
@@ -127,7 +128,7 @@ ServiceRouter ReadServiceRouter(const Settings& settings) {
     ServiceRouter router{.blUpnp = enFound == Found::kYes && std::string(conf.szSupportUpnp) == "yes"};
     if (enFound == Found::kWithoutLimit) {
         router.szRefusal =
-            "nobody has recorded how many rules the router holds, so no rules can be saved; 'tavoportmap setup' "
+            "nobody has recorded how many rules the router holds, so no rules can be saved; 'sudo tavoportmap setup' "
             "finds it out";
         return router;
     }
@@ -144,7 +145,7 @@ ServiceRouter ReadServiceRouter(const Settings& settings) {
             router.szRefusal = kManualRouter;
             break;
         default:
-            router.szRefusal = "what is remembered of the router cannot be read; 'tavoportmap setup' does it anew";
+            router.szRefusal = "what is remembered of the router cannot be read; 'sudo tavoportmap setup' does it anew";
     }
     return router;
 }

@@ -134,7 +134,7 @@ Reply Finder::Store(Way enWay, int nMaxRules) {
     reply.szMessage =
         fmt::format("the router {} is known now and is driven by {}", mDetected.szGateway, ToWords(enWay));
     if (blChanged && blRules) {
-        reply.szMessage += "; 'tavoportmap save' writes the rules that there are to it";
+        reply.szMessage += "; 'sudo tavoportmap save' writes the rules that there are to it";
     }
     reply.jsAnswer["changed"] = blChanged;
     return reply;
@@ -165,8 +165,8 @@ Reply Finder::Untested() const {
     return {.enExit = kFailed,
             .szMessage = FindingWords(Finding::kUntested, mDetected) +
                          ". Nothing was stored:\n"
-                         "  tavoportmap setup --yes                         tests it and stores the outcome\n"
-                         "  tavoportmap detect --last --save --trust-upnp   uses it untested"};
+                         "  sudo tavoportmap setup --yes                         tests it and stores the outcome\n"
+                         "  sudo tavoportmap detect --last --save --trust-upnp   uses it untested"};
 }
 
 Reply Finder::AfterTest(const TestRun& run) {
@@ -192,8 +192,8 @@ Reply Finder::AfterTest(const TestRun& run) {
     Reply reply{.enExit = kFailed,
                 .szMessage = fmt::format(
                     "its UPnP failed the test: {}. Nothing was stored. {}. What can be done:\n"
-                    "  - newer firmware, from its pages at http://{}/, then 'tavoportmap setup'\n"
-                    "  - tavoportmap detect --last --save --trust-upnp    uses it all the same; each 'save' says\n"
+                    "  - newer firmware, from its pages at http://{}/, then 'sudo tavoportmap setup'\n"
+                    "  - sudo tavoportmap detect --last --save --trust-upnp   uses it all the same; each 'save' says\n"
                     "    what the router refused\n"
                     "  - {}",
                     run.FailedWords(), AfterFailure(), Clean(mDetected.szGateway), kManualWay)};
@@ -229,7 +229,7 @@ Reply Finder::ByPages() {
                                          mDetected.szGateway)};
     if (FindingOf(mDetected) != Finding::kNeither) {
         reply.rgszWarnings.push_back(FindingWords(FindingOf(mDetected), mDetected) +
-                                     "; 'tavoportmap router set --upnp yes' or '--natpmp yes' uses that instead");
+                                     "; 'sudo tavoportmap router set --upnp yes' or '--natpmp yes' uses that instead");
     }
     return reply;
 }
@@ -244,7 +244,7 @@ std::string Finder::ForceHint() const {
         }
         return Clean(szQuoted + "'");
     };
-    return fmt::format("tavoportmap router set --brand {} --model {} --version {} --upnp yes --natpmp no",
+    return fmt::format("sudo tavoportmap router set --brand {} --model {} --version {} --upnp yes --natpmp no",
                        fnQuoted(result.szBrand), fnQuoted(result.szModel), fnQuoted(result.szVersion));
 }
 
@@ -264,11 +264,11 @@ Reply Finder::Nothing() {
         case Finding::kNameless:
             szMessage +=
                 ". Give it a name of your own to use it all the same:\n"
-                "  tavoportmap router set --brand BRAND --model MODEL --upnp yes --natpmp no\n";
+                "  sudo tavoportmap router set --brand BRAND --model MODEL --upnp yes --natpmp no\n";
             szMessage += kManualWay;
             break;
         default:
-            szMessage += fmt::format(", then run 'tavoportmap setup' again{}. {}", szStored, kManualWay);
+            szMessage += fmt::format(", then run 'sudo tavoportmap setup' again{}. {}", szStored, kManualWay);
     }
     return {.enExit = kFailed, .szMessage = szMessage};
 }

@@ -8,8 +8,8 @@ namespace tavo::cli {
 namespace {
 
 constexpr char kFindOut[] =
-    "\n  tavoportmap setup                          asks the router, tests it and remembers the answer"
-    "\n  tavoportmap router set --brand BRAND --model MODEL --upnp yes"
+    "\n  sudo tavoportmap setup                     asks the router, tests it and remembers the answer"
+    "\n  sudo tavoportmap router set --brand BRAND --model MODEL --upnp yes"
     "\n                                             says it yourself, when it cannot be found out";
 
 // Which limit of the pages is in the way, as the library reports it: by the limits alone.
@@ -84,7 +84,7 @@ std::optional<std::string> WhyUnsavable(const StoredRouter& router, const std::s
     if (!RouterUpnpDB(router.szBrand, router.szModel, router.szVersion).GetMaxRule(nMaxRules)) {
         return fmt::format(
             "nobody has recorded how many rules the router {} holds:"
-            "\n  tavoportmap router set --max-rules 32      records it; 0 when no limit is known",
+            "\n  sudo tavoportmap router set --max-rules 32  records it; 0 when no limit is known",
             router.Name());
     }
     return std::nullopt;

@@ -101,7 +101,7 @@ Reply Test(const std::vector<std::string>& rgszIds, bool blJson) {
         return NoSuchRule(*rules, szMissing);
     }
     if (std::none_of(chosen.begin(), chosen.end(), [](const Rule& rule) { return rule.blEnabled; })) {
-        return {.szMessage = "there is no rule to test that is switched on; 'tavoportmap rules list' shows them"};
+        return {.szMessage = "there is no rule to test that is switched on; 'sudo tavoportmap rules list' shows them"};
     }
     return TestRules(chosen, blJson);
 }

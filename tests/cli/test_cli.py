@@ -157,7 +157,7 @@ class Tool(unittest.TestCase):
     # ---- rules ----------------------------------------------------------------------------------
 
     def test_rules_round_trip(self):
-        self.expect("rules list", OK, "no rules are stored yet; 'tavoportmap open 443' (?s:.)*rules add web")
+        self.expect("rules list", OK, "no rules are stored yet; 'sudo tavoportmap open 443' (?s:.)*rules add web")
         self.expect("rules add web --router-port 443 --box-port 8443", OK, "rule 1 noted, not in force yet")
         self.expect("rules add --name dns --protocol all --router-port 53,5000-5001 --disabled", OK, "rule 2 noted")
         self.expect("rules add --router-port 443", USAGE, "rule 1 already forwards router port 443/tcp")
@@ -252,7 +252,7 @@ class Tool(unittest.TestCase):
                 text = text.split("\x1b[K\n")[-1]  # what the bar drew is no text
                 for line in text.split("\n"):
                     # A command stays in one piece, to be copied; so does what has no blank to break it at.
-                    if " " in line.strip() and not re.match(r"  +tavoportmap |      --", line):
+                    if " " in line.strip() and not re.match(r"  +(?:sudo )?tavoportmap |      --", line):
                         self.assertLessEqual(wide(line), width, (arguments, line))
                 run = subprocess.run([TOOL, *arguments], text=True, capture_output=True, env={**os.environ, **world})
                 whole = re.sub(r"(?m)^ *\d+ %.*\n", "", run.stdout + run.stderr)
@@ -361,7 +361,7 @@ class Tool(unittest.TestCase):
         self.store((1, "tcp", "443", "8443", "web"))
         put(RULES, get(RULES) + '[9]\nenabled="1"\nprotocol name="tcp"\nr_port="1"\ns_port="1"\nservice="\\x80\\x01"\n')
         self.expect("rules disable 9", OK, "noted")
-        self.expect("rules list", OK, r"disabled +tcp +1 +1 +\\x80\\x01 +changed, not saved\nnot saved yet: 'tavoportmap save'")
+        self.expect("rules list", OK, r"disabled +tcp +1 +1 +\\x80\\x01 +changed, not saved\nnot saved yet: 'sudo tavoportmap save'")
         self.expect("rules enable 9", OK, "noted")
         self.assertFalse(os.path.exists(DRAFT), "nothing is left to save")
         self.expect("rules remove web", OK, "noted")
@@ -375,7 +375,7 @@ class Tool(unittest.TestCase):
             os.path.exists(DRAFT) and os.unlink(DRAFT)
             damage()
             for arguments in ("rules list", "rules add --router-port 91", "save", "rules export"):
-                self.expect(arguments, FAILED, "edits that are not saved yet cannot be read .*'tavoportmap rules discard'")
+                self.expect(arguments, FAILED, "edits that are not saved yet cannot be read .*'sudo tavoportmap rules discard'")
             self.assertTrue(os.path.exists(DRAFT))
             self.expect("rules discard", OK, "the edits are dropped")
         self.expect("rules discard", OK, "nothing to drop")
@@ -541,7 +541,7 @@ class Tool(unittest.TestCase):
         """And whoever tells the router later is named: a daemon, or for a router's pages the user."""
         pid = self.keep()
         for upnp, program, later in (("yes", "upnpd", "the daemon brings the router in line"),
-                                     ("no", "tavoportforward", "'tavoportmap {}' tells it again when it is back")):
+                                     ("no", "tavoportforward", "'sudo tavoportmap {}' tells it again when it is back")):
             self.setUp()
             describe("Acme", "R1", "1")
             put(ROUTER, KNOWN % (upnp, "no") + 'conn_type="http"\nconn_port="80"\n')
@@ -703,12 +703,12 @@ class Tool(unittest.TestCase):
                  r"driven by +UPnP\n(?s:.)*Acme\\x1b(?s:.)*holds +32 rules(?s:.)*--last --save"),
                 (f"0 0 0 1 2 1 0 {steps}", "1 0 198.51.100.7 1", OK, "NAT-PMP(?s:.)*no limit known(?s:.)*outside +198.51.100.7"),
                 (f"0 0 0 1 0 0 -1 {steps}", "1 -1", OK,
-                 "(?s)answers neither UPnP nor NAT-PMP.*http://192.168.77.1/, then run 'tavoportmap setup'.*--conn-type http"),
-                (f"0 0 0 1 0 0 -1 {steps}", "1 0 198.51.100.7 1", OK, "answers NAT-PMP; 'tavoportmap setup'"),
+                 "(?s)answers neither UPnP nor NAT-PMP.*http://192.168.77.1/, then run 'sudo tavoportmap setup'.*--conn-type http"),
+                (f"0 0 0 1 0 0 -1 {steps}", "1 0 198.51.100.7 1", OK, "answers NAT-PMP; 'sudo tavoportmap setup'"),
                 (f"0 0 0 1 0 0 -1 {steps}", "1 2", OK, "refuses to be used: switch it, or UPnP, on"),
                 (f"0 0 0 0 0 0 -1 {steps}", "1 -1", OK, "no router stands in the way"),
-                (f"0 0 0 1 0 0 -1 {steps} able", "1 -1", OK, "database says that its model cannot be relied on; 'tavoportmap setup'"),
-                (f"0 0 0 1 2 0 -1 {steps}", "1 -1", OK, "nobody has recorded how far its model(?s:.)*'tavoportmap setup'"),
+                (f"0 0 0 1 0 0 -1 {steps} able", "1 -1", OK, "database says that its model cannot be relied on; 'sudo tavoportmap setup'"),
+                (f"0 0 0 1 2 0 -1 {steps}", "1 -1", OK, "nobody has recorded how far its model(?s:.)*'sudo tavoportmap setup'"),
                 (f"0 0 5 2 1 0 32 {steps}", "1 0 10.0.0.2 2", OK,
                  "(?s)gateway setting.*double NAT.*bridge.*outer router, too.*public address"),
                 (f"0 0 4 2 1 0 32 {steps}", "1 0 100.64.0.2 3", OK, "(?s)warning: the provider translates.*public IPv4 address"),
@@ -739,7 +739,7 @@ class Tool(unittest.TestCase):
                 ("", f"0 0 0 1 0 0 -1 {steps}", "1 3", "", OK, "driven by NAT-PMP(?s:.)*no connection outside now",
                  ("no", "yes")),
                 ("", f"0 0 0 1 0 0 -1 {steps} able", "1 -1", "", FAILED, "(?s)use it all the same.*router set --brand 'Acme", None),
-                ("", f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "(?s)http://192.168.77.1/, then run 'tavoportmap setup' again", None),
+                ("", f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "(?s)http://192.168.77.1/, then run 'sudo tavoportmap setup' again", None),
                 (KNOWN % ("yes", "no"), f"0 0 0 1 0 0 -1 {steps}", "1 -1", "", FAILED, "stored of it stays as it is", ("yes", "no")),
                 (pages, f"0 0 0 1 1 0 -1 {steps}", "1 -1", "", OK, "own pages(?s:.)*router set --upnp yes", ("no", "no")),
                 ("\0\1 no settings", f"0 0 0 1 1 0 32 {steps}", "1 -1", "", OK, "kept as .*router.conf.unreadable", ("yes", "no")),
@@ -947,7 +947,7 @@ class Tool(unittest.TestCase):
                 os.utime(planted, (0, 0))
             else:
                 (os.symlink if kind == "link" else os.link)("/tmp/written", planted)
-        self.expect("report", FAILED, "'tavoportmap detect' looks for it")
+        self.expect("report", FAILED, "'sudo tavoportmap detect' looks for it")
         self.expect("report", FAILED, "which this one is not(?s:.)*router.log", LD_PRELOAD=STAND_IN, TAVO_LAST="2 Acme")
         for path in files:
             if os.path.exists(path):
@@ -1400,7 +1400,7 @@ class Tool(unittest.TestCase):
     def test_a_service_has_the_router_classified(self):
         for detected, tested, code, pattern in (
                 ("0 0 0 1 1 0 32 10 80", "", OK, "by UPnP or NAT-PMP"), ("0 0 0 1 1 0 32 10 child", "", OK, "by UPnP"),
-                ("0 0 0 1 0 0 -1 10 80", "", OK, "its own pages"), ("-1 0 0 0 0 0 -1 10", "", FAILED, "'tavoportmap detect' says"),
+                ("0 0 0 1 0 0 -1 10 80", "", OK, "its own pages"), ("-1 0 0 0 0 0 -1 10", "", FAILED, "'sudo tavoportmap detect' says"),
                 ("0 0 0 1 2 0 -1 10 80", "0 0 Zeta yes 20 10 90", OK, "by UPnP"),
                 ("0 0 0 1 2 0 -1 10 80", "1 0 Zeta no -1 10 30", OK, "its own pages")):
             self.setUp()
