@@ -336,9 +336,7 @@ Reply On(bool blJson) {
         Rules before;
         const ReadState enState = ReadOff(before);
         if (enState == ReadState::kUnreadable) {
-            return Failure(
-                "what 'off' has switched off cannot be read (/etc/portforward/rules.off); 'tavoportmap rules list' "
-                "shows the rules, 'tavoportmap rules enable RULE' and 'tavoportmap save' open one again");
+            return Failure(kOffUnreadable);
         }
         if (enState == ReadState::kAbsent) {
             DropOff();

@@ -320,7 +320,7 @@ Reply Unreadable() {
 ReadState ReadOff(Rules& rules) {
     const auto inForce = LoadIfEachIsOff();
     std::string szText;
-    const ReadState enState = inForce ? ReadOwnFile(kOff, szText) : ReadState::kAbsent;
+    const ReadState enState = inForce && !inForce->empty() ? ReadOwnFile(kOff, szText) : ReadState::kAbsent;
     const auto noted = enState == ReadState::kRead ? FromFile(ObjectOf(szText)["rules"]) : std::nullopt;
     if (!noted) {
         return enState == ReadState::kAbsent ? enState : ReadState::kUnreadable;
@@ -333,6 +333,10 @@ ReadState ReadOff(Rules& rules) {
     rules = blHolds ? *noted : Rules();
     return blHolds ? ReadState::kRead : ReadState::kAbsent;
 }
+
+const char kOffUnreadable[] =
+    "what 'off' has switched off cannot be read (/etc/portforward/rules.off); 'sudo tavoportmap rules list' shows the "
+    "rules, 'sudo tavoportmap rules enable RULE' and 'sudo tavoportmap save' open one again";
 
 bool StoreOff(const Rules& rules) {
     Json::Value js;

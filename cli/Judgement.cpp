@@ -341,6 +341,9 @@ std::vector<std::string> WarningsOf(const Situation& situation) {
     if (pWord != nullptr && !pWord->blRulesReadable) {
         rgszWarnings.emplace_back(kUnreadable);
     }
+    if (situation.rules.blOffUnreadable) {
+        rgszWarnings.emplace_back(kOffUnreadable);
+    }
     if (situation.rules.blDraft) {
         rgszWarnings.push_back(situation.rules.draft
                                    ? "the changes below 'not saved yet' open and close nothing until 'sudo tavoportmap "

@@ -59,6 +59,13 @@ inline std::optional<Rules> LoadOff() {
 inline bool IsOff() {
     return LoadOff().has_value();
 }
+// It has switched rules off that nobody can tell any more.
+inline bool IsOffUnreadable() {
+    Rules rules;
+    return ReadOff(rules) == ReadState::kUnreadable;
+}
+// What to do then.
+extern const char kOffUnreadable[];
 bool StoreOff(const Rules& rules);
 bool DropOff();
 

@@ -321,8 +321,12 @@ std::optional<Reply> Objections(const Wish& wish, const Surroundings& found) {
         return reply;
     }
     if (IsOff()) {
-        return Reply{.enExit = kFailed,
-                     .szMessage = "every port is switched off, and nothing was changed; 'tavoportmap on' comes first"};
+        return Reply{
+            .enExit = kFailed,
+            .szMessage = "every port is switched off, and nothing was changed; 'sudo tavoportmap on' comes first"};
+    }
+    if (IsOffUnreadable()) {
+        return Failure(fmt::format("every port is switched off, and nothing was changed: {}", kOffUnreadable));
     }
     if (!found.plan.szCut.empty()) {
         return Reply{.enExit = kUsage, .szMessage = found.plan.szCut};

@@ -42,6 +42,7 @@ StoredRules ReadStoredRules() {
         rules.blDraft = HasDraft();
         rules.draft = rules.blDraft ? LoadDraft() : std::nullopt;
         rules.off = LoadOff();
+        rules.blOffUnreadable = IsOffUnreadable();
     }
     return rules;
 }

@@ -35,6 +35,7 @@ struct StoredRules {
     bool blDraft = false;
     std::optional<Rules> draft = {};
     std::optional<Rules> off = {};  // what 'off' switched off
+    bool blOffUnreadable = false;   // it did, and what cannot be read any more
 };
 
 // What an address on the router's other side says of the way beyond: another translation where it is a private one

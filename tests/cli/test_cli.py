@@ -598,7 +598,10 @@ class Tool(unittest.TestCase):
         self.expect("off", OK, "switched off already", **WRITES)
         noted = get(OFF)
         put(OFF, '{"rules":' + "[" * 9000)
-        self.expect("on", FAILED, "cannot be read .*rules.off.*'tavoportmap rules enable RULE'", **WRITES)
+        lost = "cannot be read .*rules.off.*'sudo tavoportmap rules enable RULE'"
+        for command, code in (("on", FAILED), ("service set hoplink 80/tcp", FAILED), ("status", OK), ("rules list", OK)):
+            self.expect(command, code, lost, **WRITES)
+        self.assertEqual([rule["enabled"] for rule in self.in_force()], [False] * 3)
         put(OFF, noted)
         self.expect("on", OK, "2 rules in force", **WRITES)
         self.assertEqual([(rule["name"], rule["enabled"]) for rule in self.in_force()],
