@@ -128,6 +128,13 @@ void OfferListeners(const std::string& szGateway, bool blAsk, Reply& reply) {
         table.Add({NameOf(listener), WhoListens(listener), szRisk.empty() ? "" : "better not: " + szRisk});
         szSafe = szSafe.empty() && szRisk.empty() ? NameOf(listener) : szSafe;
     }
+    const bool blOff = IsOff();
+    if (blOff) {
+        reply.szMessage += "\nevery port is switched off; 'sudo tavoportmap on' comes before opening another one";
+    }
+    if (rgFound.empty() && blOff) {
+        return;
+    }
     if (rgFound.empty()) {
         reply.szMessage +=
             "\nno program here waits for connections that is not forwarded yet; 'sudo tavoportmap open PORT' "
@@ -135,6 +142,9 @@ void OfferListeners(const std::string& szGateway, bool blAsk, Reply& reply) {
         return;
     }
     reply.szBody += "\nlistens on this box and is not forwarded:\n" + table.ToText();
+    if (blOff) {
+        return;
+    }
     if (!blAsk) {
         reply.szMessage += fmt::format("\n'sudo tavoportmap open {}' opens {}", szSafe.empty() ? "PORT" : szSafe,
                                        szSafe.empty() ? "a port" : "the first of them that is fit for it");

@@ -22,7 +22,13 @@ namespace tavo::cli {
 namespace {
 
 constexpr char kDirectory[] = "/etc/portforward";
-constexpr char kNext[] = "not in force yet: 'tavoportmap save' writes it to the router";
+
+// What brings an edit into force.
+const char* Next() {
+    return IsOff() ? "not in force yet: while every port is switched off nothing is saved; 'sudo tavoportmap on' comes "
+                     "first"
+                   : "not in force yet: 'sudo tavoportmap save' writes it to the router";
+}
 
 struct NewRule {
     Rule rule;
@@ -96,7 +102,7 @@ Reply AddRule(Rule rule, bool blForce) {
             return {.enExit = kUsage, .szMessage = szFault};
         }
         rules = rulesNew;
-        Reply reply{.szMessage = fmt::format("rule {} noted, {}", rule.szId, kNext)};
+        Reply reply{.szMessage = fmt::format("rule {} noted, {}", rule.szId, Next())};
         reply.jsAnswer["id"] = rule.szId;
         return reply;
     });
@@ -123,7 +129,7 @@ Reply ChangeRule(const std::string& szWhich, bool blForce, const std::function<s
         }
         rules = rulesNew;
         Reply reply{.szMessage =
-                        fmt::format("{} of rule {} noted, {}", blRemove ? "removal" : "change", szName, kNext)};
+                        fmt::format("{} of rule {} noted, {}", blRemove ? "removal" : "change", szName, Next())};
         reply.jsAnswer["id"] = szId;
         return reply;
     });
@@ -177,14 +183,18 @@ Reply ListRules() {
     WarnOfOverlaps(*rules, reply);
     if (rules->empty() && inForce->empty()) {
         reply.szMessage =
-            "no rules are stored yet; 'tavoportmap open 443' opens a port, or note a rule, for example\n"
-            "  tavoportmap rules add web --router-port 443 --box-port 8443";
+            "no rules are stored yet; 'sudo tavoportmap open 443' opens a port, or note a rule, for example\n"
+            "  sudo tavoportmap rules add web --router-port 443 --box-port 8443";
+    } else if (IsOff()) {
+        reply.szMessage = fmt::format("every port is switched off; 'sudo tavoportmap on' opens them again{}",
+                                      blEdited ? ", which comes before 'save' of what is not saved yet" : "");
     } else if (blEdited) {
         reply.szMessage =
-            "not saved yet: 'tavoportmap save' brings it into force (--dry-run shows what that does), "
-            "'tavoportmap rules discard' drops it";
-    } else if (IsOff()) {
-        reply.szMessage = "every port is switched off; 'tavoportmap on' opens them again";
+            "not saved yet: 'sudo tavoportmap save' brings it into force (--dry-run shows what that does), "
+            "'sudo tavoportmap rules discard' drops it";
+    }
+    if (IsOffUnreadable()) {
+        reply.rgszWarnings.emplace_back(kOffUnreadable);
     }
     return reply;
 }
@@ -234,7 +244,7 @@ Reply Import(const std::string& szPath, bool blReplace, bool blForce) {
             return {.enExit = kUsage, .szMessage = szOverlap + "\nNothing was changed"};
         }
         rules = rulesNew;
-        Reply reply{.szMessage = fmt::format("{} noted, {}", Count(imported->size(), "rule"), kNext)};
+        Reply reply{.szMessage = fmt::format("{} noted, {}", Count(imported->size(), "rule"), Next())};
         reply.jsAnswer["imported"] = static_cast<Json::UInt>(imported->size());
         return reply;
     });

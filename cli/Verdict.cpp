@@ -6,6 +6,7 @@
 
 #include "Account.h"
 #include "Pages.h"
+#include "RuleStore.h"
 
 namespace tavo::cli {
 
@@ -172,8 +173,9 @@ Reply StoreSettings(const std::string& szGateway, __tag_TAVO_ROUTER_CONF conf, i
             return Failure("the settings are stored, but " + *szFault);
         }
     }
-    Reply reply{.szMessage = fmt::format(
-                    "stored as the settings of the router {}; 'tavoportmap save' writes the rules to it", szGateway)};
+    Reply reply{.szMessage =
+                    fmt::format("stored as the settings of the router {}; 'sudo tavoportmap {}' writes the rules to it",
+                                szGateway, IsOff() ? "on" : "save")};
     const auto left = blDaemon ? LeftByPages() : std::nullopt;
     if (left && !left->rgLeftOver.empty()) {
         reply.rgszWarnings.push_back(

@@ -573,7 +573,11 @@ class Tool(unittest.TestCase):
             told = self.json("setup", "--yes", **world)[1]["could_be_opened"]
             self.assertEqual([(entry["port"], entry["protocol"], bool(entry["risk"])) for entry in told],
                              [(445, "tcp", True), (7102, "tcp", False), (7103, "tcp", False), (7105, "udp", False)])
-            self.expect("setup --yes", OK, "(?s)445 +\\S+ +better not: .*7105/udp.*'tavoportmap open 7102' opens the first", **world)
+            self.expect("setup --yes", OK, "(?s)445 +\\S+ +better not: .*7105/udp.*'sudo tavoportmap open 7102' opens the first", **world)
+            self.expect("off", OK, "every port is closed", **WRITES)
+            code, text = on_terminal("setup", **world)
+            self.assertEqual((code, "Which of them" in text, "open 7102" in text), (OK, False, False), text)
+            self.assertIn("'sudo tavoportmap on' comes before", text)
             for typed, opened in ((b"\n", []), (b"no\n", []), (b"7102, 7105/udp\n", ["7102", "7105"]), (b"445\nn\n", [])):
                 self.store((1, "tcp", "80", "7104", "web"))
                 os.unlink(ROUTER)
@@ -592,7 +596,9 @@ class Tool(unittest.TestCase):
         self.assertFalse(os.path.exists(OFF))
         self.expect("off", OK, "every port is closed", **WRITES)
         self.assertEqual([rule["enabled"] for rule in self.in_force()], [False] * 3)
-        tool("rules", "add", "new", "--router-port", "91")
+        self.expect("rules add new --router-port 91", OK, "'sudo tavoportmap on' comes first", **WRITES)
+        for command in ("router set --max-rules 9", "rules list"):
+            self.expect(command, OK, "'sudo tavoportmap on'(?!(?s:.)*tavoportmap save)", **WRITES)
         for command in ("open 92", "save", "service set hoplink 80/tcp"):
             self.expect(command, FAILED, "every port is switched off(?s:.)*tavoportmap on", **WRITES)
         self.expect("off", OK, "switched off already", **WRITES)
