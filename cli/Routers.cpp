@@ -21,6 +21,14 @@ struct Wish {
     bool blUpdate = false;
 };
 
+constexpr char kNoServer[] =
+    "no server is named to fetch descriptions from (database_url in [download] of /etc/tavo/platform.conf)";
+constexpr char kHowToDescribe[] = "/usr/share/doc/tavoportmap/packaging/routerdb/README.md";
+
+bool IsServerNamed() {
+    return *GetRouterDBPath() != '\0';
+}
+
 bool Matches(const __tag_TAVO_ROUTERDB_LIST& model, const std::vector<std::string>& rgszWords) {
     const std::string szAll =
         CLI::detail::to_lower(std::string(model.szBrand) + " " + model.szModel + " " + model.szVersion);
@@ -63,9 +71,11 @@ Reply List(const std::vector<std::string>& rgszWords) {
         return reply;
     }
     if (nModels == 0) {
-        reply.szMessage =
-            "no router descriptions are installed. Your own go to /etc/tavo/routerdb; 'tavoportmap routers --update' "
-            "fetches those of the server that database_url in /etc/tavo/platform.conf names";
+        reply.szMessage = fmt::format(
+            "no router descriptions are installed. Your own go to /etc/tavo/routerdb ({} says how); {}", kHowToDescribe,
+            IsServerNamed() ? "'sudo tavoportmap routers --update' fetches those of the server that "
+                              "database_url in /etc/tavo/platform.conf names"
+                            : kNoServer);
     } else {
         reply.szMessage = fmt::format("none of the {} known routers matches; try a shorter word", nModels);
     }
@@ -74,10 +84,11 @@ Reply List(const std::vector<std::string>& rgszWords) {
 
 // What a refresh says: an error, the version, or why there was nothing to do.
 Reply Update(int& nVersion) {
-    if (*GetRouterDBPath() == '\0') {
-        return Failure(
-            "no server is named to fetch router descriptions from (database_url in /etc/tavo/platform.conf); "
-            "'tavoportmap routers' lists those of this box");
+    if (const auto reply = NeedsRoot()) {
+        return *reply;
+    }
+    if (!IsServerNamed()) {
+        return Failure(kNoServer);
     }
     if (TLibUpdateRouterDBList(&nVersion) == 1) {
         return {};

@@ -3,6 +3,8 @@
 
 #include <fmt/format.h>
 
+#include "tavo/portforward.h"
+
 namespace tavo::cli {
 
 namespace {
@@ -11,6 +13,8 @@ constexpr char kFindOut[] =
     "\n  sudo tavoportmap setup                     asks the router, tests it and remembers the answer"
     "\n  sudo tavoportmap router set --brand BRAND --model MODEL --upnp yes"
     "\n                                             says it yourself, when it cannot be found out";
+
+constexpr char kFetch[] = "\n  sudo tavoportmap routers --update          fetches the newest descriptions";
 
 // Which limit of the pages is in the way, as the library reports it: by the limits alone.
 void ReportPages(RouterDB& db, int nMaxPort, int nMaxRange, SaveResult& result) {
@@ -75,11 +79,10 @@ std::optional<std::string> WhyUnsavable(const StoredRouter& router, const std::s
                    ? std::nullopt
                    : std::optional(
                          fmt::format("there is no description of the router {}, which is driven through its own pages:"
-                                     "\n  tavoportmap routers                        shows the models that are known"
-                                     "\n  tavoportmap routers --update               fetches the newest descriptions"
-                                     "\n  tavoportmap router set --brand ... --model ... --version ..."
+                                     "\n  tavoportmap routers                        shows the models that are known{}"
+                                     "\n  sudo tavoportmap router set --brand ... --model ... --version ..."
                                      "\n                                             names one of them",
-                                     router.Name()));
+                                     router.Name(), *GetRouterDBPath() == '\0' ? "" : kFetch));
     }
     if (!RouterUpnpDB(router.szBrand, router.szModel, router.szVersion).GetMaxRule(nMaxRules)) {
         return fmt::format(

@@ -674,7 +674,10 @@ class Tool(unittest.TestCase):
         put(ROUTER, (KNOWN % ("yes", "no")).replace("R1", "R2"))
         self.expect("save", FAILED, r"how many rules the router Acme R2 \(1\) holds(?s:.)*--max-rules")
         put(ROUTER, KNOWN % ("no", "no"))
-        self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*routers --update")
+        self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*tavoportmap routers  +shows(?!(?s:.)*--update)")
+        put("/etc/tavo/platform.conf", '[download]\ndatabase_url="http://127.0.0.1:1"\n')
+        self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*sudo tavoportmap routers --update  ")
+        os.unlink("/etc/tavo/platform.conf")
         put(ROUTER, KNOWN % ("yes", "no"))
         tool("rules", "add", "--router-port", "81")
         self.expect("save", TOO_MANY, "holds 1 rule and there are 2")
@@ -1468,8 +1471,8 @@ class Tool(unittest.TestCase):
 
     def test_models(self):
         os.makedirs(MODELS)
-        self.expect("routers", OK, "no router descriptions are installed.*database_url")
-        self.expect("routers --update", FAILED, "no server is named")
+        self.expect("routers", OK, "no router descriptions are installed.*README.md says how.; no server is named .*database_url")
+        self.expect("routers --update", FAILED, "^error: no server is named to fetch descriptions from [^;]*\n$")
         for brand, model, version in (("Acme", "R1", "1.0"), ("Acme", "R2 Plus", "2.0"), ("Zeta", "Z", "1")):
             describe(brand, model, version)
         for search, models in (((), ["R1", "R2 Plus", "Z"]), (("ACME",), ["R1", "R2 Plus"]), (("plus", "acme"), ["R2 Plus"])):
