@@ -294,8 +294,11 @@ Outcome JudgeRules(const Situation& situation, const std::vector<RuleFact>& rgRu
                                        : fmt::format("{} of {} rules {} why{}", nWrong, nWanted, szRest, szAsOf)};
     }
     if (nUnknown > 0) {
-        return {Standing::kUntold,
-                fmt::format("{} of {} cannot be told yet{}", nUnknown, Count(nWanted, "rule"), szAsOf)};
+        return {Standing::kUntold, situation.IsByPages()
+                                       ? fmt::format("{} of {} cannot be told: the router's pages did not answer as "
+                                                     "they should, and nobody looks at them again; {}",
+                                                     nUnknown, Count(nWanted, "rule"), kSave)
+                                       : fmt::format("{} of {} cannot be told yet", nUnknown, Count(nWanted, "rule"))};
     }
     return {Standing::kInForce, nWanted == 1 ? "the rule is in force" + szAsOf
                                              : fmt::format("all {} rules are in force{}", nWanted, szAsOf)};

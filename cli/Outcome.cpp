@@ -33,6 +33,10 @@ constexpr Cause kCauses[] = {
      "switch it on in its own pages (http://{}/), or 'sudo tavoportmap setup' looks for another way"},
     {"silent", "the router {} does not answer", "often it helps to restart the router"},
 };
+// Pages that nobody serves at their port look the same from here.
+constexpr Cause kNoPages = {"unreachable", "the pages of the router {} cannot be reached",
+                            "look at its power and at the cable, or at the Wi-Fi, and whether its pages are where "
+                            "'sudo tavoportmap router show' says ('router set --conn-type, --conn-port')"};
 
 // Nothing when the router was spoken to.
 std::optional<std::string> WhyAway(const Published& published, const std::string& szGateway) {
@@ -41,13 +45,14 @@ std::optional<std::string> WhyAway(const Published& published, const std::string
     if (pCause == std::end(kCauses)) {
         return std::nullopt;
     }
-    const std::string szWhat = fmt::format(fmt::runtime(pCause->szWhat), szGateway);
-    const std::string szDo = fmt::format(fmt::runtime(pCause->szDo), szGateway);
+    const bool blPages = published.szProtocol == "pages";
+    const Cause& cause = blPages && published.szRouter == kNoPages.szRouter ? kNoPages : *pCause;
+    const std::string szWhat = fmt::format(fmt::runtime(cause.szWhat), szGateway);
+    const std::string szDo = fmt::format(fmt::runtime(cause.szDo), szGateway);
     // Of those that are written once nobody tries again.
     const std::string szLater =
-        published.szProtocol == "pages"
-            ? fmt::format("'tavoportmap {}' tells it again when it is back", IsOff() ? "off" : "save")
-            : "the daemon brings the router in line with them as soon as it is back";
+        blPages ? fmt::format("'sudo tavoportmap {}' tells it again when it is back", IsOff() ? "off" : "save")
+                : "the daemon brings the router in line with them as soon as it is back";
     return fmt::format(
         "{}: nothing was refused, and what is open there is not known. The rules are stored; {}\n{}; 'tavoportmap "
         "status' shows how it is",
@@ -96,7 +101,12 @@ size_t NotOpen(const Published& published) {
 
 // What to do about ports that are not open.
 const char* Remedy(const Published& published) {
-    if (published.szProtocol == "pages" && published.szRouterWhy.find("password") != std::string::npos) {
+    const bool blAccount =
+        published.szRouterWhy.find("password") != std::string::npos ||
+        std::any_of(published.rgRules.begin(), published.rgRules.end(), [](const PublishedRule& rule) {
+            return rule.enState == PortState::kRefused && rule.szWhy.find("password") != std::string::npos;
+        });
+    if (published.szProtocol == "pages" && blAccount) {
         return "'sudo tavoportmap router set --ask-password' stores another password, and '--user' another name";
     }
     if (published.szProtocol == "pages" && !published.szRouterWhy.empty()) {

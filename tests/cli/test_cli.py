@@ -558,6 +558,22 @@ class Tool(unittest.TestCase):
                 self.expect(command, AWAY, f"{pattern}(?s:.)*cannot be reached(?s:.)*{later.format(again)}", **WRITES)
             self.assertEqual(self.in_force(), [])
 
+    def test_what_pages_did_not_do_leads_to_their_account_and_their_port(self):
+        pid = self.keep()
+        describe("Acme", "R1", "1")
+        put(ROUTER, KNOWN % ("no", "no") + 'conn_type="http"\nconn_port="80"\n')
+        self.store((1, "tcp", "443", "443", "web"))
+        for state, why, router, code, pattern in (
+                ("refused", "the router does not accept the user name or the password", "ok", REFUSED, "router set --ask-password' stores"),
+                ("refused", "another device has this port on the router", "ok", REFUSED, "Choose other router ports"),
+                ("unknown", "no web server", "unreachable", AWAY, "the pages of the router 192.168.77.1 cannot be (?s:.)*router show'")):
+            row = {"name": "443/tcp", "router_port": 443, "box_port": 443, "protocol": "tcp", "rule": "web", "state": state,
+                   "word": "", "why": why, "holder": None, "since": None, "until": None}
+            self.publish(pid, name="tavoportforward", protocol="pages", router=router, rules=[row], at=int(time.time()) + 60)
+            self.expect("save", code, pattern, **WRITES)
+        put("/etc/tavoinfo.conf", "")
+        self.expect("status", FAILED, "1 of 1 rule cannot be told: the router's pages did not answer .*tavoportmap save'")
+
     def test_setup_offers_what_listens_here_and_opens_what_is_chosen(self):
         world = {**WRITES, "TAVO_DETECT": "0 0 0 1 1 0 32 10 20 30 40 70 50 80", "TAVO_WORD": "1 -1"}
         with contextlib.ExitStack() as keep:
