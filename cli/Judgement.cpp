@@ -172,7 +172,8 @@ std::string WhySwitchedOff(const Situation& situation) {
     }
     return fmt::format(
         "nothing is kept: neither daemon may map. The keys runupnpportmapping and runnatpmpportmapping in "
-        "/etc/tavoinfo.conf are switched off, as a save or a detection that failed may leave them; {}",
+        "/etc/tavoinfo.conf are switched off, as a save or a detection that failed may leave them, or another way to "
+        "the router until its first save; {}",
         kSave);
 }
 
@@ -266,8 +267,9 @@ std::optional<Outcome> JudgeWish(const Situation& situation, size_t nWanted) {
         return std::nullopt;
     }
     if (situation.rules.off) {
-        return Outcome{Standing::kOff, fmt::format("switched off: {} wait for 'sudo tavoportmap on'",
-                                                   Count(situation.rules.off->size(), "rule"))};
+        return Outcome{Standing::kOff, fmt::format("switched off: {} {} for 'sudo tavoportmap on'",
+                                                   Count(situation.rules.off->size(), "rule"),
+                                                   situation.rules.off->size() == 1 ? "waits" : "wait")};
     }
     return Outcome{Standing::kNothingAsked,
                    situation.rules.inForce->empty()

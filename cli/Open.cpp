@@ -41,9 +41,9 @@ std::string MakeRule(const OpenWish& wish, Rule& rule) {
     if (!ports) {
         const std::string szNearest = Nearest(wish.szWhat, PresetNames());
         return fmt::format(
-            "'{}' is neither a port nor a name of one{}: write 443, 5000-5010, 53/udp, a name of /etc/services, or one "
-            "of {}",
-            Clean(wish.szWhat), szNearest.empty() ? "" : fmt::format("; did you mean '{}'?", szNearest),
+            "'{}' is neither a port nor a name of one{} Write a port from 1 to 65535 such as 443, 5000-5010, 53/udp, a "
+            "name of /etc/services, or one of {}; --to names another port of this box",
+            Clean(wish.szWhat), szNearest.empty() ? "." : fmt::format("; did you mean '{}'?", szNearest),
             Join(PresetNames()));
     }
     rule.szRouterPorts = ports->szPorts;
@@ -111,7 +111,8 @@ Reply SaveOpening(const Rule& rule, bool& blAlready, bool blJson) {
             fmt::format("\nPort {} itself, which was asked for, is open on the router", Clean(rule.szRouterPorts));
     } else if (reply.enExit != kOk && AreStored(opening.rules) && !blAlready) {
         reply.szMessage +=
-            fmt::format("\nThe rule stays; 'tavoportmap close {}' takes it back", Clean(rule.szRouterPorts));
+            fmt::format("\nThe rule stays; 'sudo tavoportmap close {}{}' takes it back", Clean(rule.szRouterPorts),
+                        rule.szProtocol == "all" ? "" : "/" + rule.szProtocol);
     }
     return reply;
 }

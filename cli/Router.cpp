@@ -213,6 +213,7 @@ void OfferSet(CLI::App& router, Request& request) {
 void OfferRouter(CLI::App& app, Request& request) {
     CLI::App* pRouter = AddCommand(app, "router", "the router: its stored settings (show, set), its table");
     pRouter->require_subcommand(1);
+    pRouter->footer("'sudo tavoportmap setup' finds out what the router is and stores it; 'set' says it by hand.\n");
     const auto pShowPassword = std::make_shared<bool>(false);
     CLI::App* pShow = AddCommand(*pRouter, "show", "what is stored for the current gateway");
     pShow->add_flag("--show-password", *pShowPassword, "show the password, too");

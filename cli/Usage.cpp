@@ -129,7 +129,8 @@ size_t Distance(const std::string& szOne, const std::string& szOther) {
 
 Reply Unknown(const std::string& szWhat, const std::string& szList, const std::string& szUnknown,
               const std::vector<std::string>& rgszKnown) {
-    const std::string szNearest = Nearest(szUnknown, rgszKnown);
+    const std::string szNearest =
+        szUnknown == "help" || szUnknown == "version" ? "--" + szUnknown : Nearest(szUnknown, rgszKnown);
     Reply reply{.enExit = kUsage,
                 .szMessage = fmt::format("{}{}\n{}: {}", szWhat,
                                          szNearest.empty() ? "" : fmt::format("; did you mean '{}'?", szNearest),

@@ -114,6 +114,17 @@ class Tool(unittest.TestCase):
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
         self.expect("save", OK, "in force|no rule is switched on", **WRITES)
 
+    def test_a_hint_names_sudo_where_root_is_needed(self):
+        """In the texts of the sources, wherever a text is broken into lines."""
+        roots = r"(setup|open|close|off|on|save|detect|compat|report|test|service|rules|router (set|show)|routers --update|{})"
+        folder = f"{SOURCE}/cli"
+        for name in sorted(os.listdir(folder)):
+            lines = [line for line in get(f"{folder}/{name}").split("\n") if not line.lstrip().startswith("//")]
+            text = re.sub(r'"\s*\n\s*"', "", "\n".join(lines))
+            for wrong in re.findall(rf"(?<!sudo )\btavoportmap {roots}(?![\w-])(?! --help| set --help|{{}}--help)", text):
+                self.fail(f"{name}: 'tavoportmap {wrong[0]}' without sudo")
+            self.assertNotIn("sudo sudo", text, name)
+
     # ---- arguments ------------------------------------------------------------------------------
 
     def test_wrong_arguments_are_answered_with_the_right_ones(self):
@@ -123,6 +134,8 @@ class Tool(unittest.TestCase):
                 ("rulse", "rules", "did you mean 'rules'"),
                 ("rules lsit", "list", "did you mean 'list'.*\n.*list, add, remove, enable, disable"),
                 ("rules enabl 1", "enable", "did you mean 'enable'"),
+                ("help", "--help", "did you mean '--help'"),
+                ("version", "--version", "did you mean '--version'"),
                 ("xyzzy", None, "there is no command 'xyzzy'\n"),
                 ("rules add --nmae x", "--name", "no option '--nmae' for 'rules add'; did you mean '--name'"),
                 ("save --jsno", "--json", "did you mean '--json'"),
