@@ -84,7 +84,8 @@ void AddLeftByPages(const std::vector<PublishedLeftOver>& rgLeft, const Rules& r
     reply.enExit = reply.enExit == kOk ? kRefused : reply.enExit;
     reply.szMessage = fmt::format(
         "{}the router's own pages, which are not in use any more, still forward {} and did not take that away: {}\n"
-        "'sudo tavoportmap {}' tries again; or take it away there by hand",
+        "'sudo tavoportmap {}' tries again; or take it away there by hand, and then call\n"
+        "'sudo /usr/tavo/bin/tavoportforward --forget'",
         szBefore, NamesOf(rgLeft), Clean(rgLeft.front().szWhy), IsOff() ? "off" : "save");
 }
 

@@ -222,7 +222,7 @@ int LeaveEarly(bool blJson, Progress& progress) {
         {.enExit = kFailed,
          .szMessage = "the save is ended before it stored a rule: the old rules are in force. The router's own "
                       "pages go on taking away what they forward, so that it is closed until the next "
-                      "'tavoportmap save'"},
+                      "'sudo tavoportmap save'"},
         blJson);
 }
 

@@ -35,7 +35,7 @@ using tavo::Refusal;
 using tavo::Value;
 
 constexpr char kHelp[] =
-    "Usage: tavoportforward [--take-away | --left | --version | --check FILE... | --help]\n"
+    "Usage: tavoportforward [--take-away | --left | --forget | --version | --check FILE... | --help]\n"
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
     "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
     "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
@@ -45,6 +45,8 @@ constexpr char kHelp[] =
     "  --take-away takes away all that it made, also when UPnP or NAT-PMP drives the router by now: with the\n"
     "              account that /etc/portforward/router_account.conf keeps since\n"
     "  --left      says, as that file does, what the record has; asks no router\n"
+    "  --forget    drops from the record what this router's pages forward while they are not in use: for who has\n"
+    "              taken it away by hand\n"
     "  --version   the version of the operations syntax that this tool understands\n"
     "  --check     says of router.ops and router.des (by that ending) files what is wrong with them\n"
     "  --help      this text\n"
@@ -249,7 +251,7 @@ int ShowLeft() {
     std::string szWhy;
     const bool blKnown = Load(router, true, szWhy);
     szWhy = blKnown
-                ? "the router's own pages forward it; the next 'sudo tavoportmap save', or 'off', has them take it away"
+                ? "the router's own pages forward it; 'sudo tavoportmap off', or the next save, has them take it away"
                 : "the router's own pages forward it: take it away there (" + szWhy + ")";
     tavo::Record record = tavo::MadeFile(kMadeFile).Get();
     tavo::RunResult left = LeftBy(record, router, szWhy);
@@ -261,6 +263,33 @@ int ShowLeft() {
             "again should it be back";
     }
     std::fputs(tavo::TextOf(left).c_str(), stdout);
+    return kAllInPlace;
+}
+
+// What a person took away there: without a list nobody else would ever notice.
+int ForgetLeft() {
+    KnownRouter router;
+    std::string szWhy;
+    const ConfList pRouters(TAVOPFGwRouterConfGet());
+    if (!FindAddresses(router, szWhy)) {
+        std::fprintf(stderr, "tavoportforward: %s\n", szWhy.c_str());
+        return kNotTried;
+    }
+    const TAVO_PF_CONF* pSection = SectionOf(pRouters.get(), router.szGateway);
+    if (pSection != nullptr && !Value(pSection, "conn_type").empty()) {
+        std::fputs("tavoportforward: the router's pages are in use: what no rule asks for goes by the next save\n",
+                   stderr);
+        return kNotTried;
+    }
+    tavo::MadeFile made(kMadeFile);
+    tavo::TakeOverEarlierRecord(made);
+    LeftBy(made.Get(), router, {});  // turns to this router
+    made.Get().Here().clear();
+    if (!made.Save()) {
+        std::fprintf(stderr, "tavoportforward: %s cannot be written\n", kMadeFile);
+        return kNotTried;
+    }
+    tavo::Tell({.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = false});
     return kAllInPlace;
 }
 
@@ -294,7 +323,8 @@ int main(int argc, char** argv) {
     const std::string_view szOption = argc == 2 ? argv[1] : "";
     const bool blTakeAway = szOption == "--take-away";
     const bool blLeft = szOption == "--left";
-    if (argc > 1 && !blTakeAway && !blLeft) {
+    const bool blForget = szOption == "--forget";
+    if (argc > 1 && !blTakeAway && !blLeft && !blForget) {
         if (std::strcmp(argv[1], "--version") == 0) {
             std::printf("syntax version=%d\n", tavo::kSyntaxVersion);
             return kAllInPlace;
@@ -314,7 +344,7 @@ int main(int argc, char** argv) {
     signal(SIGPIPE, SIG_IGN);
     openlog("tavoportforward", LOG_PID, LOG_DAEMON);
     try {
-        return blLeft ? ShowLeft() : Locked(blTakeAway ? TakeAway : Run);
+        return blLeft ? ShowLeft() : Locked(blTakeAway ? TakeAway : blForget ? ForgetLeft : Run);
     } catch (const std::exception& error) {
         return NotTried(error.what());
     }

@@ -249,6 +249,7 @@ class Manual(unittest.TestCase):
                 webs.append(LAB.router)
                 self.saved({("tcp", 5001): (BOX, 5001), ("udp", 5003): (BOX, 5003)}, "1,1,tcp,5001,5001", "2,1,udp,5003,5003")
                 made = LAB.read(RECORD)
+                self.assertIn("are in use", LAB.run("box", f"{TOOL} --forget", check=False).stderr)
                 LAB.start_router()  # somebody has switched its UPnP on
                 self.assertIn("5001/tcp, 5003/udp", told(0, "router set --brand Lab --model One --version 1 --upnp yes")["warnings"][0])
                 self.assertEqual(names(told(6, "status")), ["5001/tcp", "5003/udp"], "until the first save")
@@ -261,6 +262,10 @@ class Manual(unittest.TestCase):
                     self.assertIn("does not accept the user name or the password", answer["message"])
                     self.assertEqual(names(told(0, "status")), ["5001/tcp", "5003/udp"])
                     self.assertTrue(LAB.reaches("udp", 5003))
+                    kept = LAB.read(RECORD)
+                    self.assertEqual(LAB.run("box", f"{TOOL} --forget").returncode, 0)
+                    self.assertEqual(names(told(0, "status")), [], "taken away by hand, says the user")
+                    LAB.write(RECORD, kept)
                     LAB.write(account, good)
                     told(0, again)
                     told(0, "save")
