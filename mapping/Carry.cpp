@@ -24,6 +24,7 @@ constexpr char kLost[] = "lost";        // the router said yes, and does not sho
 constexpr char kKept[] = "kept";        // it said yes to the removal, and shows it
 constexpr int64_t kRenewAgain = 60;     // seconds after a renewal that was refused
 constexpr int64_t kRecordAgain = 60;    // seconds after the record could not be written
+constexpr int64_t kLookForLost = 10;    // seconds until one more look for what was not shown
 constexpr int64_t kCloseAgain = 10;     // seconds until an older place of a port of the box may be closed
 
 class Carrier {
@@ -57,6 +58,8 @@ private:
     uint16_t OlderPlace(const Place& place) const;
     void ReadBack();
     void Confirm(Place& place);
+    void OnLost(const Place& place, const RouterReply& reply);
+    bool IsLost(Place& place);
 
     Places& mPlaces;
     PlaceList mRgpWritten;  // to be read back
@@ -73,6 +76,7 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
     place.gone = mPlaces.Known(place);
     place.szWhyGone = szWhy;
     place.before.reset();
+    mPlaces.habit.setLost.erase(place.key);
     RouterReply reply = Note(mPlaces.router.Remove(place.gone));
     const Made* pMade = mPlaces.MadeAt(place);
     if (mPlaces.what.blForm && !mPlaces.what.blShows && reply.enReply == Reply::kNoSuchEntry && pMade != nullptr &&
@@ -303,6 +307,9 @@ bool Carrier::Add(Place& place, bool blAnew) {
         place.verdict = RefusedBy({Reply::kElsewhere, it->second});
         return false;
     }
+    if (blAnew && IsLost(place)) {
+        return false;
+    }
     if (const uint16_t nOlder = OlderPlace(place); nOlder != 0) {
         place.verdict = {PortState::kWaiting, "the router has not closed port " + std::to_string(nOlder) + " yet"};
         mPlaces.Wake(mPlaces.Now() + kCloseAgain);
@@ -455,9 +462,36 @@ void Carrier::Confirm(Place& place) {
     } else if (place.enSeen == Seen::kPresent && place.entry.szClient != Box()) {
         place.verdict = InTheWay(mPlaces, place.entry);
         Forget(place);
-    } else {  // or only slow to show it: it stays on record, as one that was not shown
+    } else {
         place.verdict = {PortState::kRefused, kLost};
+        OnLost(place, reply);
     }
+}
+
+// The router may only be slow to show it: it stays on record for one more look, and is not asked for until then.
+void Carrier::OnLost(const Place& place, const RouterReply& reply) {
+    if (reply.enReply == Reply::kNoSuchEntry && mPlaces.what.blForm) {
+        Forget(place);
+    } else if (reply.enReply == Reply::kNoSuchEntry) {
+        mPlaces.habit.setLost.insert(place.key);
+        mPlaces.Wake(mPlaces.Now() + kLookForLost);
+    }
+}
+
+// That look. Whatever comes to its place after it is somebody else's. True: it is not shown yet, or lost.
+bool Carrier::IsLost(Place& place) {
+    const Made* pMade = mPlaces.MadeAt(place);
+    const bool blLooked = mPlaces.IsLookedFor(place);
+    if (blLooked) {
+        place.verdict = {PortState::kRefused, kLost};
+        if (const int64_t nLook = pMade->nAsked + kLookForLost; mPlaces.Now() < nLook) {
+            mPlaces.Wake(nLook);
+            return true;
+        }
+        Forget(place);
+    }
+    mPlaces.habit.setLost.erase(place.key);
+    return blLooked;
 }
 
 PassResult Carrier::Run(const std::vector<RouterMapping>& rgWanted) {
@@ -519,6 +553,7 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
                        const Surroundings& around) {
     if (habit.router != record.Router()) {
         habit.mapElsewhere.clear();
+        habit.setLost.clear();
         habit.router = record.Router();
     }
     Places places(router, rgWanted, record, habit, around);

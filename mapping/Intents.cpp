@@ -67,7 +67,7 @@ void NoteIntents(Places& places, const PlaceList& rgpPlaces) {
     for (Place* pPlace : rgpPlaces) {
         const Action enAction = places.StepFor(*pPlace).enAction;
         if (enAction == Action::kAdd || enAction == Action::kChange) {
-            if (places.habit.mapElsewhere.contains(pPlace->key)) {
+            if (places.habit.mapElsewhere.contains(pPlace->key) || places.IsLookedFor(*pPlace)) {
                 continue;  // it is not asked for now
             }
             rgpAsked.push_back(pPlace);

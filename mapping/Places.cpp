@@ -62,6 +62,12 @@ bool Places::IsServed(const Place& place) const {
     return place.enSeen == Seen::kPresent && Serves(place.entry, *place.pWanted, around.szBox);
 }
 
+bool Places::IsLookedFor(const Place& place) {
+    const Made* pMade = MadeAt(place);
+    return habit.setLost.contains(place.key) && pMade != nullptr && !pMade->blShown && !pMade->blBefore &&
+           place.enSeen == Seen::kAbsent && Serves(MappingOf(place.key, *pMade, 0), *place.pWanted, around.szBox);
+}
+
 bool Places::IsOthers(const Place& place) {
     const auto it = around.mapOthers.find(place.key);
     return it != around.mapOthers.end() && it->second == Known(place).nBoxPort;
@@ -123,6 +129,7 @@ void Places::Show(const RouterMapping& entry, Place& place) {
     pMade->szText = entry.szDescription;
     pMade->nBoxPort = entry.nBoxPort;
     pMade->other = {};
+    habit.setLost.erase(place.key);
     // How long a lease is shows right after it was granted; later listings show what is left of it, or nothing new.
     if (place.blWritten || !pMade->blShown) {
         pMade->nLease = pMade->nLease == 0 ? entry.nLease : std::min(pMade->nLease, entry.nLease);

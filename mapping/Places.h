@@ -42,7 +42,9 @@ struct Places {
     Made* MadeAt(const Place& place);  // our record of it; null: there is none
     Step StepFor(const Place& place);
     bool IsServed(const Place& place) const;  // it is there, and leads where it is wanted to
-    bool IsOthers(const Place& place);        // another daemon of this box has it lead where it leads
+    // The router said yes to it, and is to be looked at once more before it is asked again.
+    bool IsLookedFor(const Place& place);
+    bool IsOthers(const Place& place);  // another daemon of this box has it lead where it leads
     // What is known of what is at a place: what the router shows, else what was asked for.
     RouterMapping Known(const Place& place);
 

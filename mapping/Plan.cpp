@@ -17,6 +17,9 @@ Step Unwanted(const PlaceView& view, const std::string& szBox, int64_t nNow, boo
             }
             return view.pMade == nullptr ? Step{} : Step{Action::kRemove, "no rule asks for what we made here"};
         case Seen::kAbsent:
+            if (view.pMade != nullptr && view.pMade->MayShowLate(nNow)) {
+                return {Action::kRemove, "no rule asks for it, and the router may only not show it yet"};
+            }
             return view.pMade == nullptr ? Step{} : Step{Action::kForget, "the router has it no more"};
         default:
             break;

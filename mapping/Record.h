@@ -78,7 +78,11 @@ struct Made {
         return (blShown || blLeases) && End() >= 0 && nNow > End() + kSurely;
     }
 
+    // Whether the router may have it and only not show it yet.
+    bool MayShowLate(int64_t nNow) const { return !blShown && !blBefore && nNow - nAsked <= kShows; }
+
     static constexpr int64_t kSurely = 60;  // seconds after its end until a lease is believed to have ended
+    static constexpr int64_t kShows = 20;   // seconds until a router shows what it has
 };
 
 // What goes on record of a mapping that was asked for at that time; and back, with so many seconds of its lease left.

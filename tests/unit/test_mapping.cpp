@@ -672,7 +672,41 @@ TEST(Mapping, WhatIsShownOnlyAfterAWhileIsOurs) {
         EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp lost"});
         core.Run(router, {});
         EXPECT_TRUE(core.record.Here().empty()) << "a later look has shown nothing";
+
+        router.mNSwallowed = 0;  // its rule goes before it is shown
+        router.mBlShows = false;
+        core.Run(router, rgWanted);
+        router.mBlListNothing = true;
+        core.nNow += 2;
+        core.Run(router, {});
+        EXPECT_TRUE(router.mMapTable.empty());
+        EXPECT_TRUE(core.record.Here().empty());
     }
+}
+
+// A router that keeps nothing, where another program of this box has the place later.
+TEST(Mapping, WhatWasLostIsSomebodyElsesLater) {
+    MemoryRouter router;
+    Core core;
+    router.mNSwallowed = 1;
+    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
+    const auto result = core.Run(router, rgWanted);
+    EXPECT_EQ(Texts(result), Rows{"1/tcp lost"});
+    EXPECT_EQ(result.nNextSeconds, 10) << "for one more look";
+    // Seconds until the next pass, what is then to be waited for, and whether it asked for the mapping.
+    for (const auto& [nLater, nNext, blAsks] :
+         {std::tuple{4, 6, false}, {6, 0, false}, {110, 10, true}, {10, 0, false}}) {
+        core.nNow += nLater;
+        const int nCalls = router.mNCalls;
+        const auto later = core.Run(router, rgWanted);
+        EXPECT_EQ(Texts(later), Rows{"1/tcp lost"});
+        EXPECT_EQ(later.nNextSeconds, nNext);
+        EXPECT_EQ(router.mNCalls - nCalls > 2, blAsks);
+    }
+    router.Put(Entry(1, 1, kBox, "game"));
+    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp 1 others"});
+    core.Run(router, {});
+    EXPECT_EQ(router.mMapTable.size(), 1U);
 }
 
 // The change was asked for, the process died, the router restarted, and another program has the place.
