@@ -239,6 +239,7 @@ private:
         mPRecord->TurnTo(Name());
         mPRecord->Prune(mNNow - mNBootAt, mRouter.habits.blBlind);
         const tavo::Record recordBefore = *mPRecord;
+        const std::set<MappingKey> setLost = mHabit.setLost;
         mNAdds = 0;
         mHabit.nLease = mRouter.habits.blForm ? 0 : 3600;
         tavo::PassResult result;
@@ -267,7 +268,7 @@ private:
         CheckStrangers(mapBefore);
         CheckWords(result, nAllowance != 0);
         if (mNPeace >= kPassesToPeace) {
-            CheckPeace(result);
+            CheckPeace(result, setLost);
         }
         if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.enList == tavo::Reply::kOk) {
             CheckCost(result, mRouter.nRequests - nRequestsBefore, *mPRecord != recordBefore);
@@ -398,7 +399,8 @@ private:
         }
     }
 
-    void CheckPeace(const tavo::PassResult& result) {
+    // setLost: the places that this pass only looked at.
+    void CheckPeace(const tavo::PassResult& result, const std::set<MappingKey>& setLost) {
         size_t nUsed = 0;
         for (const auto& [key, entry] : mRouter.mMapTable) {
             nUsed += mRouter.At(key) != nullptr ? 1 : 0;
@@ -427,8 +429,8 @@ private:
                 (pEntry->mapping.szClient != mRouter.szBox || pEntry->mapping.nBoxPort != mRgWanted[i].nBoxPort);
             const bool blNotShownYet = mRouter.habits.blSlowToShow && pEntry != nullptr && pEntry->nMade == mNNow;
             const bool blForgone = mBlDiskFull && result.rgOutcomes[i].verdict.szWord == tavo::kUnrecorded;
-            if (blFree && !blInTheWay && !blNotShownYet && !blWaits && !blShared && !blForgone &&
-                result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
+            if (blFree && !setLost.contains(key) && !blInTheWay && !blNotShownYet && !blWaits && !blShared &&
+                !blForgone && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
                 Broken("could be open and is not (" + result.rgOutcomes[i].verdict.szWord + ")", key);
             }
         }
