@@ -243,7 +243,7 @@ bool Carrier::Do(Place& place, const Step& step) {
             return Replace(place, step.szWhy);
         case Action::kKeep:
             if (mPlaces.MadeAt(place) == nullptr) {  // made before there was a record; its age is not known
-                mPlaces.rows[place.key] = RowOf(place.entry, true, mPlaces.Now());
+                mPlaces.Adopt(place, RowOf(place.entry, true, mPlaces.Now()));
             }
             place.verdict = Open(mPlaces, place);
             LookAgain(place);
@@ -496,7 +496,7 @@ bool Carrier::IsLost(Place& place) {
 
 PassResult Carrier::Run(const std::vector<RouterMapping>& rgWanted) {
     mNReadBack = mPlaces.Now();
-    mPlaces.around.fnSave();  // what could not be written before
+    mPlaces.Save();  // what could not be written before
     mPlaces.LookAtTable();
     PlaceList rgpUnwanted;
     for (auto& [key, place] : mPlaces.mapPlaces) {
@@ -516,7 +516,7 @@ PassResult Carrier::Run(const std::vector<RouterMapping>& rgWanted) {
     }
     BringAll(std::move(rgpWanted));
     PassResult result = Conclude(mPlaces, rgWanted, mApplied);
-    mPlaces.around.fnSave();
+    mPlaces.Save();
     return result;
 }
 

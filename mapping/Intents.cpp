@@ -25,8 +25,9 @@ bool Intend(Places& places, const Place& place) {
     // What was shown is known by its text from then on. One that the router gives to everybody's stays what it is.
     const bool blText = pMade != nullptr && pMade->blShown && pMade->szText.starts_with(kOwnPrefix) &&
                         pMade->szText != mapping.szDescription;
-    const bool blNews = pMade == nullptr || pMade->szClient != mapping.szClient ||
-                        pMade->nBoxPort != mapping.nBoxPort || pMade->nMore != mapping.nMore || blText;
+    const bool blNews = pMade == nullptr || places.habit.setUnsaved.contains(place.key) ||
+                        pMade->szClient != mapping.szClient || pMade->nBoxPort != mapping.nBoxPort ||
+                        pMade->nMore != mapping.nMore || blText;
     Made made = RowOf(mapping, false, places.Now());
     // What was taken away there is gone when the new one is shown: a form has to be applied, and some only say yes.
     if (place.before && (place.before->szClient != made.szClient || place.before->nBoxPort != made.nBoxPort)) {
@@ -47,7 +48,7 @@ void Put(Places& places, const PlaceList& rgpAsked, bool blNews) {
             rgBefore.emplace_back(pPlace, std::move(before));
         }
     }
-    if ((!blNews && rgBefore.empty()) || places.around.fnSave()) {
+    if ((!blNews && rgBefore.empty()) || places.Save()) {
         return;
     }
     for (const auto& [pPlace, before] : rgBefore) {
@@ -72,8 +73,9 @@ void NoteIntents(Places& places, const PlaceList& rgpPlaces) {
             }
             rgpAsked.push_back(pPlace);
         } else if (enAction == Action::kRenew && places.MadeAt(*pPlace) == nullptr) {  // made before there was a record
-            places.rows[pPlace->key] = RowOf(pPlace->entry, true, 0);
-            places.rows[pPlace->key].blBefore = true;
+            Made made = RowOf(pPlace->entry, true, 0);
+            made.blBefore = true;
+            places.Adopt(*pPlace, std::move(made));
             blNews = true;
         }
     }

@@ -24,8 +24,10 @@ struct Habits {
     // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
     // are not asked for again while they stand here.
     std::map<MappingKey, std::string> mapElsewhere = {};
-    int64_t nElsewhereSince = 0;        // seconds of boot time: none of them is older
-    MappingKey next = {};               // where to go on, after a pass that its time was too short for
+    int64_t nElsewhereSince = 0;  // seconds of boot time: none of them is older
+    MappingKey next = {};         // where to go on, after a pass that its time was too short for
+    // Rows that were made of what the router showed, and could not be put where they survive us yet.
+    std::set<MappingKey> setUnsaved = {};
     RouterName router = {};             // that gave them: another one at the same address may have the places free
     std::set<MappingKey> setLost = {};  // where it said yes at the last asking, and has shown nothing yet
 };

@@ -52,6 +52,19 @@ Made* Places::MadeAt(const Place& place) {
     return it == rows.end() ? nullptr : &it->second;
 }
 
+void Places::Adopt(const Place& place, Made made) {
+    rows[place.key] = std::move(made);
+    habit.setUnsaved.insert(place.key);
+}
+
+bool Places::Save() {
+    const bool blSaved = around.fnSave();
+    if (blSaved) {
+        habit.setUnsaved.clear();
+    }
+    return blSaved;
+}
+
 Step Places::StepFor(const Place& place) {
     const PlaceView view{place.pWanted, place.enSeen, place.enSeen == Seen::kPresent ? &place.entry : nullptr,
                          MadeAt(place)};

@@ -60,6 +60,9 @@ struct Places {
     // it no longer shows together with others are not asked for one by one.
     void LookForGone(const PlaceList& rgpPlaces);
 
+    // Puts a row on record that stands in memory alone until the next saving.
+    void Adopt(const Place& place, Made made);
+    bool Save();
     void Wake(int64_t nAt) { nNext = std::min(nNext, nAt); }
     int64_t Now() const { return around.fnNow(); }
 

@@ -763,6 +763,22 @@ TEST(Mapping, WithoutARecordAPortThatIsOpenIsNamedAsItIs) {
     EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 7);
 }
 
+// What was made before there was a record is on it in memory alone, while the disk is full.
+TEST(Mapping, WhatIsKnownInMemoryAloneIsNotAskedForAgain) {
+    for (const uint32_t nLease : {0U, 3600U}) {
+        MemoryRouter router;
+        Core core;
+        core.blDiskFull = true;
+        router.Put(Entry(1, 1, kBox, "tavo:a")).nLease = nLease;
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1"});
+        router.mMapTable.clear();
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp unrecorded"});
+        EXPECT_TRUE(router.mMapTable.empty());
+        core.blDiskFull = false;
+        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1 anew"});
+    }
+}
+
 // Each look takes a second, and a pass has a hundred and fifty: the next one goes on where it ended, and what is not
 // reached yet is unknown, at a router that answers.
 TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
