@@ -56,7 +56,7 @@ class Detection(unittest.TestCase):
         LAB.serve(5002)
         LAB.start_router()
         sh("rm -f /etc/portforward/router.conf /etc/portforward/rule.conf")
-        self.assertIn("'tavoportmap setup'", LAB.run("box", f"{TOOL} detect").stdout)
+        self.assertIn("'sudo tavoportmap setup'", LAB.run("box", f"{TOOL} detect").stdout)
         LAB.run("box", f"{TOOL} setup --yes")
         LAB.run("box", f"{TOOL} rules add web --router-port 5001 --box-port 5002")
         self.assertFalse(LAB.reaches("tcp", 5001))
