@@ -123,8 +123,7 @@ const char* Remedy(const Published& published) {
     return nShared == NotOpen(published)
                ? "Choose another port of this box ('sudo tavoportmap rules edit RULE --box-port PORT')"
                : "Choose other router ports ('sudo tavoportmap rules edit') or free them there, and another port of "
-                 "this "
-                 "box where another rule has it";
+                 "this box where another rule has it";
 }
 
 }  // namespace

@@ -115,13 +115,14 @@ void Carrier::OnGone(Place& place) {
 // What the router was told to take away, all of it together. Where it does not say what it has, its yes has to do; what
 // it still shows is taken away again by the next pass, unless it was only slow to go.
 void Carrier::CheckGone() {
-    PlaceList rgpGone = std::exchange(mRgpGone, {});
-    std::erase_if(rgpGone, [this](const Place* pPlace) {  // what came of those shows in what was made in their place
-        if (Made* pMade = mPlaces.MadeAt(*pPlace); pPlace->pWanted != nullptr && pMade != nullptr) {
-            pMade->other = {};
+    PlaceList rgpGone;
+    for (Place* pPlace : std::exchange(mRgpGone, {})) {
+        if (pPlace->pWanted == nullptr) {
+            rgpGone.push_back(pPlace);
+        } else if (Made* pMade = mPlaces.MadeAt(*pPlace); pMade != nullptr) {
+            pMade->other = {};  // what came of it shows in what was made in its place
         }
-        return pPlace->pWanted != nullptr;
-    });
+    }
     if (mPlaces.what.blShows) {
         mPlaces.LookForGone(rgpGone);
     }

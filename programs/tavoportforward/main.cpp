@@ -149,6 +149,11 @@ const TAVO_PF_CONF* SectionOf(const TAVO_PF_CONF* pSection, const std::string& s
     return pSection;
 }
 
+// Whether these settings have the router driven through its pages.
+bool IsInUse(const TAVO_PF_CONF* pSection) {
+    return pSection != nullptr && !Value(pSection, "conn_type").empty();
+}
+
 // blAside: where the settings are not those of the pages, what was put aside will do.
 bool Load(KnownRouter& router, bool blAside, std::string& szWhy) {
     if (!FindAddresses(router, szWhy)) {
@@ -156,7 +161,7 @@ bool Load(KnownRouter& router, bool blAside, std::string& szWhy) {
     }
     ConfList pRouters(TAVOPFGwRouterConfGet());
     const TAVO_PF_CONF* pSection = SectionOf(pRouters.get(), router.szGateway);
-    if (blAside && (pSection == nullptr || Value(pSection, "conn_type").empty())) {
+    if (blAside && !IsInUse(pSection)) {
         pRouters = tavo::LoadConfList(kAside);
         pSection = SectionOf(pRouters.get(), router.szGateway);
     }
@@ -221,10 +226,14 @@ int Run() {
     return Bring(router, made, std::move(jobs), true);
 }
 
+tavo::RouterName NameOf(const KnownRouter& router) {
+    return {router.szGateway, tavo::HardwareAddress(router.szGateway)};
+}
+
 // What the router in front has by the record, each with that reason for being there still.
 tavo::RunResult LeftBy(tavo::Record& record, const KnownRouter& router, const std::string& szWhy) {
     tavo::RunResult result{.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = false};
-    record.TurnTo({router.szGateway, tavo::HardwareAddress(router.szGateway)});
+    record.TurnTo(NameOf(router));
     for (const tavo::Outcome& left : tavo::LeftOnRecord(record, {}, {}, {}, tavo::BootSeconds())) {
         result.rgRefusals.push_back({left.szName, szWhy, {}, tavo::RefusalKind::kRemoval, false});
     }
@@ -275,15 +284,14 @@ int ForgetLeft() {
         std::fprintf(stderr, "tavoportforward: %s\n", szWhy.c_str());
         return kNotTried;
     }
-    const TAVO_PF_CONF* pSection = SectionOf(pRouters.get(), router.szGateway);
-    if (pSection != nullptr && !Value(pSection, "conn_type").empty()) {
+    if (IsInUse(SectionOf(pRouters.get(), router.szGateway))) {
         std::fputs("tavoportforward: the router's pages are in use: what no rule asks for goes by the next save\n",
                    stderr);
         return kNotTried;
     }
     tavo::MadeFile made(kMadeFile);
     tavo::TakeOverEarlierRecord(made);
-    LeftBy(made.Get(), router, {});  // turns to this router
+    made.Get().TurnTo(NameOf(router));
     made.Get().Here().clear();
     if (!made.Save()) {
         std::fprintf(stderr, "tavoportforward: %s cannot be written\n", kMadeFile);
