@@ -422,12 +422,13 @@ TEST_F(RelayService, MemoryThatRunsOutLosesNoRule) {
     for (const char* szLine :
          {"GetInitState() failed", "CreateOperationRulesArray(ruleConf) failed", "new set<int> failed",
           "save rule failed", "test port connection failed", "TLibGetRouterConf() failed", "can not get router conf",
-          "pArr is NULL", "TLibParsePorts() for boxPort failed", "malloc() failed"}) {
+          "TLibParsePorts() for boxPort failed",
+#ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
+          "CreateRulesArray() failed", "pArr is NULL", "malloc() failed"
+#endif
+         }) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;
     }
-#ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
-    EXPECT_TRUE(said.contains("CreateRulesArray() failed"));
-#endif
 }
 
 // ---- the router classified ------------------------------------------------------------------------------------

@@ -364,7 +364,11 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
     }
     for (const char* szLine :
          {"fail to get brand", "get max rule fail", "add rule failed", "can not get max ports",
-          "sync rule to file fail", "failed to allocate list", "malloc fail: szRemap", "get router conf failed"}) {
+          "sync rule to file fail", "failed to allocate list", "get router conf failed",
+#ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
+          "malloc fail: szRemap"
+#endif
+         }) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;
     }
 }
