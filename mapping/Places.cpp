@@ -211,6 +211,24 @@ bool Places::IsListedWithout(const PlaceList& rgpPlaces) {
     return blWithout;
 }
 
+// What a range does not show is gone where the router says so of one of the places by name, too: some leave out what
+// they have.
+void Places::LookForGoneInRanges(const PlaceList& rgpPlaces) {
+    PlaceList rgpCovered;
+    LookAtRanges(rgpPlaces, [&](Place& place) {
+        if (place.gone.szClient == around.szBox) {  // a range shows the asker's own mappings
+            rgpCovered.push_back(&place);
+        }
+    });
+    std::erase_if(rgpCovered, [](const Place* pPlace) { return pPlace->enSeen != Seen::kUnknown; });
+    if (rgpCovered.empty() || guard.IsOver() || !Look(*rgpCovered.front()).IsRefusal()) {
+        return;
+    }
+    for (Place* pPlace : rgpCovered) {
+        pPlace->enSeen = Seen::kAbsent;
+    }
+}
+
 void Places::LookForGone(const PlaceList& rgpPlaces) {
     for (Place* pPlace : rgpPlaces) {
         pPlace->enSeen = Seen::kUnknown;
@@ -219,13 +237,8 @@ void Places::LookForGone(const PlaceList& rgpPlaces) {
         return;
     }
     const bool blForm = what.blForm;  // one look reads the list for all
-    const auto fnAbsent = [](Place& place) { place.enSeen = Seen::kAbsent; };
     if (!blForm) {
-        LookAtRanges(rgpPlaces, [&](Place& place) {
-            if (place.gone.szClient == around.szBox) {  // a range shows the asker's own mappings
-                fnAbsent(place);
-            }
-        });
+        LookForGoneInRanges(rgpPlaces);
     }
     PlaceList rgpOpen;
     std::copy_if(rgpPlaces.begin(), rgpPlaces.end(), std::back_inserter(rgpOpen),
@@ -233,7 +246,7 @@ void Places::LookForGone(const PlaceList& rgpPlaces) {
     if (!blForm && !rgpOpen.empty() && rgpOpen.size() == rgpPlaces.size() && IsListedWithout(rgpOpen)) {
         std::for_each(rgpOpen.begin(), rgpOpen.end(), [&](Place* pPlace) {
             if (pPlace->enSeen == Seen::kUnknown) {
-                fnAbsent(*pPlace);
+                pPlace->enSeen = Seen::kAbsent;
             }
         });
     }

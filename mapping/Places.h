@@ -82,6 +82,7 @@ struct Places {
 private:
     void Show(const RouterMapping& entry, Place& place);
     bool IsListedWithout(const PlaceList& rgpPlaces);
+    void LookForGoneInRanges(const PlaceList& rgpPlaces);
     void Recall();
 };
 

@@ -66,7 +66,7 @@ std::string Habits::Text() const {
         {!blOverwrites, "718 for a change"},
         {nCapacity < 1000, blSaysFull ? "small" : "small and does not say so"},
         {enList != tavo::Reply::kOk, "lists badly"},
-        {blRanges, "ranges"},
+        {blRanges, blRangesLie ? "ranges that lie" : "ranges"},
         {blSaysChanged, "says changed"},
         {blBlind, "blind"},
         {blKeepsRemoved, "keeps removed"},
@@ -185,7 +185,8 @@ Reply Router::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t
     }
     return Answer([&]() -> Reply {
         for (const auto& [key, shown] : View()) {
-            if (key.first == szProtocol && key.second >= nFirst && key.second <= nLast) {
+            const bool blShown = !habits.blRangesLie || shown.szClient != szBox;
+            if (blShown && key.first == szProtocol && key.second >= nFirst && key.second <= nLast) {
                 rgMappings.push_back(shown);
             }
         }

@@ -45,6 +45,7 @@ public:
                                        tavo::Reply::kTooLong, tavo::Reply::kRefused, tavo::Reply::kRefused};
         habits.enList = rgLists[Pick(6)];
         habits.blRanges = OneIn(3);
+        habits.blRangesLie = OneIn(4);
         habits.blSaysChanged = OneIn(6);
         habits.blBlind = OneIn(4);
         habits.blSecure = habits.blSecure || habits.blBlind;
