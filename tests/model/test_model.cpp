@@ -198,15 +198,30 @@ private:
         mNNext = mNNow;
     }
 
+    // What leads where ours was asked to lead, and was not shown yet, nobody can tell from it.
+    static bool IsOnRecord(const tavo::Record& record, const RouterMapping& entry) {
+        const auto it = record.Here().find(tavo::KeyOf(entry));
+        return it != record.Here().end() && it->second.IsEntry(entry);
+    }
+    tavo::Record DiskRecord() const {
+        tavo::Record disk(mSzDisk, "");
+        disk.TurnTo(Name());
+        return disk;
+    }
+
     // Another host, or another program of this box, takes a place or leaves it.
     void Stranger() {
         const MappingKey key = AnyKey();
         const model::Router::Entry* pEntry = mRouter.At(key);
         if (pEntry == nullptr) {
             const std::string szClient = OneIn(2) ? kStranger : mRouter.szBox;
-            mRouter.mMapTable[key] = {{key.first, key.second, static_cast<uint16_t>(200 + Pick(3)), szClient,
-                                       mRouter.TextOf("game"), 0, true}};
-            Tell("stranger " + szClient + " takes " + key.first + std::to_string(key.second));
+            const bool blBlind = mRouter.habits.blBlind || mRouter.habits.blMute;
+            const auto nBoxPort = static_cast<uint16_t>((OneIn(2) && !blBlind ? 100 : 200) + Pick(3));
+            model::Router::Entry entry = {{key.first, key.second, nBoxPort, szClient, mRouter.TextOf("game"), 0, true}};
+            entry.blOrphan = IsOnRecord(*mPRecord, entry.mapping) || IsOnRecord(DiskRecord(), entry.mapping);
+            mRouter.mMapTable[key] = entry;
+            Tell("stranger " + szClient + ":" + std::to_string(nBoxPort) + " takes " + key.first +
+                 std::to_string(key.second));
         } else if (!pEntry->blBox && !pEntry->blOrphan) {
             mRouter.mMapTable.erase(key);
             Tell("stranger leaves " + key.first + std::to_string(key.second));
@@ -309,9 +324,7 @@ private:
     // Every mapping is on record before the router is asked, and what cannot be put there is not asked for.
     void CheckOnRecord(const MappingKey& key) {
         ++mNAdds;
-        tavo::Record disk(mSzDisk, "");
-        disk.TurnTo(Name());
-        if (!disk.Here().contains(key)) {
+        if (!DiskRecord().Here().contains(key)) {
             Broken("asked for and not on record", key);
         }
     }
