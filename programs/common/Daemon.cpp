@@ -66,7 +66,9 @@ constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(10);
 constexpr auto kEndLimit = std::chrono::seconds(20);   // for another instance: a pass, and the mappings
 constexpr auto kSettle = std::chrono::seconds(1);      // an address rarely changes alone
-constexpr auto kLeastPause = std::chrono::seconds(5);  // between passes that others than we can cause
+// Between passes: that anybody on the network can cause, and that this box's own addresses, routes and links do.
+constexpr auto kRouterPause = std::chrono::seconds(5);
+constexpr auto kNetworkPause = std::chrono::seconds(2);
 constexpr auto kStartLimit = std::chrono::seconds(5);  // of an instance that somebody else starts
 constexpr int kPollMilliseconds = 20;
 constexpr int kWaitMilliseconds = 3600 * 1000;  // the timer comes before
@@ -212,7 +214,7 @@ void Frame::Wait() {
                                      [](const pollfd& waiting) { return waiting.revents != 0; });
     const bool blRouter = blSpoke && mMapper.OnWake();
     const bool blNetwork = rgWaiting[2].revents != 0 && mNetwork.TakeChange() && mMapper.OnNetworkChange();
-    const auto early = std::max(Clock::now() + kSettle, mWoken + kLeastPause);
+    const auto early = std::max(Clock::now() + kSettle, mWoken + (blNetwork ? kNetworkPause : kRouterPause));
     if ((blRouter || blNetwork) && early < mNext) {
         mNext = early;
         mBlWoken = true;
