@@ -42,8 +42,10 @@ void UpnpMapper::LostRouter() {
 // Where does the router's service live. False: there is none that we can use.
 bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
+        const std::string szKnown = mSzLocation;
         mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation, 0, fnStop);
         if (mPIgd != nullptr) {
+            mHabit.blPermanentOnly = mHabit.blPermanentOnly && mSzLocation == szKnown;  // it may be another one
             mEvents.TurnTo(mPIgd->Service().events, Box());
             Remember();
         }

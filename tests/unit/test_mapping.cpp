@@ -1255,6 +1255,23 @@ TEST(Record, OfEveryPortIsReadBack) {
     std::remove(kFile);
 }
 
+TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
+    class Old : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            return mapping.nLease != 0 ? IgdReply(tavo::kIgdOnlyPermanentLeases) : MemoryRouter::Add(mapping);
+        }
+    };
+    for (const auto& [szOther, blLease] : {std::pair("bb", true), {"aa", false}, {"", false}}) {
+        Core core;
+        Old old;
+        core.Run(old, Wanted(1), "aa");
+        MemoryRouter other;
+        core.Run(other, Wanted(1), szOther);
+        EXPECT_EQ((other.mMapTable.at({"TCP", 1}).nLease != 0), blLease) << szOther;
+    }
+}
+
 // The neighbour's hardware is not always known. A pass without it must not make one router's rows another one's.
 TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
     tavo::Record record("", "one");

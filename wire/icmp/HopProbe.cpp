@@ -1,4 +1,4 @@
-// Walks towards a host with UDP probes. Relies on IP_RECVERR. Promises: see Walk.h.
+// Walks towards a host with UDP probes. Relies on IP_RECVERR. Promises: see HopProbe.h.
 #include "wire/icmp/HopProbe.h"
 
 #include <linux/errqueue.h>

@@ -1,5 +1,5 @@
 // Keeps what was learnt about each gateway. Relies on the platform's sectioned files.
-// Promises: see Known.h.
+// Promises: see GatewayMemory.h.
 #include "wire/upnp/GatewayMemory.h"
 
 #include <netinet/in.h>

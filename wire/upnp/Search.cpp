@@ -1,5 +1,5 @@
 // SSDP: M-SEARCH to the gateway and to the group, answers filtered by who sent them.
-// Relies on one UDP socket of its own. Promises: see Ssdp.h.
+// Relies on one UDP socket of its own. Promises: see Search.h.
 #include "wire/upnp/Search.h"
 
 #include <arpa/inet.h>

@@ -1,5 +1,5 @@
 // Reaches for hosts and names outside. Relies on sockets that do not block and on the C library's
-// resolver with a clock of ours. Promises: see Outside.h.
+// resolver with a clock of ours. Promises: see Reachability.h.
 #include "platform/linux/net/Reachability.h"
 
 #include <arpa/inet.h>
