@@ -108,6 +108,47 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_FALSE(tavo::ParseDescription("", location));
 }
 
+// What a router says it is, and where its service is, of a description that others would not read.
+TEST(Igd, BrokenDescriptionsAreReadAsFarAsTheyGo) {
+    const std::string szService =
+        "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1</serviceType><controlURL>/c</controlURL>"
+        "</service>";
+    const auto fnDevice = [&](const std::string& szModel, const std::string& szMore = "") {
+        return "<root xmlns='urn:x'><device><modelName>" + szModel + "</modelName>" + szMore + "<serviceList>" +
+               szService + "</serviceList></device></root>";
+    };
+    const std::string szLatin1 = "Stra\xDF" "e";
+    const std::string szUtf8 = "Stra\xC3\x9F" "e";
+    std::string szAttributes;
+    for (int i = 0; i < 20000; ++i) {
+        szAttributes += " a" + std::to_string(i) + "=''";
+    }
+    const std::pair<std::string, std::string> rgCases[] = {
+        {fnDevice("M"), "M"},
+        {fnDevice("M") + "trailing <text/>", "M"},
+        {"\r\n <?xml version='1.0'?>" + fnDevice("M"), "M"},
+        {fnDevice("M", "<open><presentationURL>/</presentationURL>"), "M"},
+        {fnDevice("M", "</wrong>"), "M"},
+        {fnDevice("M", "<a>x & y < z</a>"), "M"},
+        {fnDevice("M", "<a b=c d>x</a>"), "M"},
+        {fnDevice("M", "<u:unknown>x</u:unknown>"), "M"},
+        {fnDevice("M").substr(0, fnDevice("M").find("</serviceList>")), "M"},
+        {"\xEF\xBB\xBF" + fnDevice(szUtf8), szUtf8},
+        {fnDevice(szUtf8), szUtf8},
+        {fnDevice(szLatin1), szUtf8},
+        {"<?xml version='1.0' encoding='utf-8'?>" + fnDevice(szLatin1), szUtf8},
+        {"<?xml version='1.0' encoding='ISO-8859-1'?>" + fnDevice(szLatin1), szUtf8},
+        {"<?xml version='1.0' encoding='gibberish'?>" + fnDevice(szLatin1), szUtf8},
+        {"<!DOCTYPE r [<!ENTITY e 'x'><!ENTITY f '&e;&e;'>]>" + fnDevice("M&f;&lt;"), "M<"},
+        {"<!DOCTYPE r [<!ENTITY e SYSTEM '/etc/passwd'>]>" + fnDevice("M&e;"), "M"},
+        {fnDevice("M", "<a" + szAttributes + "/>"), "none"}};
+    for (const auto& [szXml, szModel] : rgCases) {
+        const auto service = tavo::ParseDescription(szXml, {"192.168.1.1", 80, "/"});
+        EXPECT_EQ(service ? service->model.szModel : "none", szModel) << szXml.substr(0, 300);
+        EXPECT_EQ(service ? service->control.Text() : "http://192.168.1.1:80/c", "http://192.168.1.1:80/c");
+    }
+}
+
 TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
     const auto fnModel = [](const std::string& szDevice) {
         const std::string szXml = "<u:root xmlns:u='x'><u:device>" + szDevice +

@@ -11,8 +11,6 @@ namespace tavo {
 
 namespace {
 
-using tinyxml2::XMLElement;
-
 // A mark of a text that is too long to be kept (32-bit FNV-1a).
 std::string MarkOf(std::string_view szText) {
     uint32_t nHash = 2166136261U;
@@ -29,13 +27,8 @@ bool IsInsideCharacter(char c) {
 }
 
 // One text of what the router says it is.
-std::string ModelText(const XMLElement* pDevice, std::string_view szName) {
-    const XMLElement* pElement = pDevice->FirstChildElement();
-    while (pElement != nullptr && LocalName(*pElement) != szName) {
-        pElement = pElement->NextSiblingElement();
-    }
-    const char* szRaw = pElement == nullptr ? nullptr : pElement->GetText();
-    std::string szText(szRaw == nullptr ? "" : szRaw);
+std::string ModelText(const XmlElement& device, std::string_view szName) {
+    std::string szText = device.Child(szName).Raw();
     szText = Trim(PrintableText(szText, szText.size()));
     if (szText.size() > kMaxModelText) {
         const std::string szMark = MarkOf(szText);
@@ -53,29 +46,26 @@ bool MapsPorts(const std::string& szType) {
            szType.starts_with("urn:schemas-upnp-org:service:WANPPPConnection:");
 }
 
-// The first service below pElement that maps ports.
-const XMLElement* FindService(const XMLElement* pElement, int nDepth = 0) {
-    for (; pElement != nullptr && nDepth < kMaxXmlDepth; pElement = pElement->NextSiblingElement()) {
-        if (LocalName(*pElement) == "service" && MapsPorts(TextOf(pElement->FirstChildElement("serviceType")))) {
-            return pElement;
+// The first service below an element that maps ports.
+XmlElement FindService(const XmlElement& element, int nDepth = 1) {
+    for (XmlElement child = nDepth < kMaxXmlDepth ? element.Child() : XmlElement(); child; child = child.Next()) {
+        if (child.Name() == "service" && MapsPorts(child.Child("serviceType").Text())) {
+            return child;
         }
-        if (const XMLElement* pFound = FindService(pElement->FirstChildElement(), nDepth + 1)) {
-            return pFound;
+        if (const XmlElement found = FindService(child, nDepth + 1)) {
+            return found;
         }
     }
-    return nullptr;
+    return {};
 }
 
-IgdModel ReadModel(const XMLElement* pRoot) {
-    const XMLElement* pDevice = FindElement(pRoot, "device");
-    if (pDevice == nullptr) {
-        return {};
-    }
-    IgdModel model{ModelText(pDevice, "manufacturer"), ModelText(pDevice, "modelName"), ""};
+IgdModel ReadModel(const XmlElement& root) {
+    const XmlElement device = root.Name() == "device" ? root : root.Find("device");
+    IgdModel model{ModelText(device, "manufacturer"), ModelText(device, "modelName"), ""};
     // The first two are no standard elements; the routers that have them keep the number for the model.
     for (const char* szName : {"firmwareVersion", "softwareVersion", "modelNumber"}) {
         if (model.szVersion.empty()) {
-            model.szVersion = ModelText(pDevice, szName);
+            model.szVersion = ModelText(device, szName);
         }
     }
     return model;
@@ -102,25 +92,21 @@ std::optional<HttpUrl> ResolveAddress(const std::string& szAddress, const std::s
 }  // namespace
 
 std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location) {
-    tinyxml2::XMLDocument document;
-    if (document.Parse(szXml.data(), szXml.size()) != tinyxml2::XML_SUCCESS) {
+    const XmlDocument document(szXml);
+    const XmlElement service = FindService(document.Root());
+    if (!service) {
         return std::nullopt;
     }
-    const XMLElement* pService = FindService(document.RootElement());
-    if (pService == nullptr) {
-        return std::nullopt;
-    }
-    const std::string szBase =
-        TextOf(FindElement(document.RootElement()->FirstChildElement(), "URLBase", kMaxXmlDepth - 1));
+    const std::string szBase = document.Root().Child("URLBase").Text();
     const auto fnResolve = [&](const char* szName) {
-        return ResolveAddress(TextOf(pService->FirstChildElement(szName)), szBase, location);
+        return ResolveAddress(service.Child(szName).Text(), szBase, location);
     };
     const auto control = fnResolve("controlURL");
     if (!control) {
         return std::nullopt;
     }
-    return IgdService{TextOf(pService->FirstChildElement("serviceType")), *control, fnResolve("eventSubURL"),
-                      ReadModel(document.RootElement())};
+    return IgdService{service.Child("serviceType").Text(), *control, fnResolve("eventSubURL"),
+                      ReadModel(document.Root())};
 }
 
 }  // namespace tavo

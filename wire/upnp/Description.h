@@ -1,5 +1,5 @@
 // The description of an Internet Gateway Device: what it says it is, and where its port-mapping service lives.
-// Relies on tinyxml2. Promises: only the gateway's own addresses come out of it; texts are printable and bounded.
+// Relies on Xml. Promises: only the gateway's own addresses come out of it; texts are printable and bounded.
 #pragma once
 
 #include <optional>

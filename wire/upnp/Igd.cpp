@@ -8,13 +8,10 @@
 
 #include "wire/upnp/Search.h"
 #include "wire/upnp/Soap.h"
-#include "wire/upnp/Xml.h"
 
 namespace tavo {
 
 namespace {
-
-using tinyxml2::XMLElement;
 
 constexpr int kMaxEntries = 65536;
 constexpr auto kListLimit = std::chrono::seconds(8);  // then who asks goes on by name
@@ -25,23 +22,23 @@ bool IsAddress(const std::string& szText) {
 }
 
 // What an entry's answer says beyond its key.
-bool ReadEntry(const XMLElement* pRoot, IgdEntry& mapping) {
-    const auto nBoxPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewInternalPort")));
-    mapping.szClient = TextOf(FindElement(pRoot, "NewInternalClient"));
+bool ReadEntry(const XmlElement& root, IgdEntry& mapping) {
+    const auto nBoxPort = ParseNumber<uint16_t>(root.Find("NewInternalPort").Text());
+    mapping.szClient = root.Find("NewInternalClient").Text();
     if (!nBoxPort || !IsAddress(mapping.szClient)) {
         return false;
     }
     mapping.nBoxPort = *nBoxPort;
-    mapping.szDescription = TextOf(FindElement(pRoot, "NewPortMappingDescription"));
-    mapping.nLease = ParseNumber<uint32_t>(TextOf(FindElement(pRoot, "NewLeaseDuration"))).value_or(0);
-    const std::string szEnabled = TextOf(FindElement(pRoot, "NewEnabled"));
+    mapping.szDescription = root.Find("NewPortMappingDescription").Text();
+    mapping.nLease = ParseNumber<uint32_t>(root.Find("NewLeaseDuration").Text()).value_or(0);
+    const std::string szEnabled = root.Find("NewEnabled").Text();
     mapping.blEnabled = szEnabled != "0" && szEnabled != "false" && szEnabled != "no";
     return true;
 }
 
-bool ReadKey(const XMLElement* pRoot, IgdEntry& mapping) {
-    const auto nRouterPort = ParseNumber<uint16_t>(TextOf(FindElement(pRoot, "NewExternalPort")));
-    mapping.szProtocol = TextOf(FindElement(pRoot, "NewProtocol"));
+bool ReadKey(const XmlElement& root, IgdEntry& mapping) {
+    const auto nRouterPort = ParseNumber<uint16_t>(root.Find("NewExternalPort").Text());
+    mapping.szProtocol = root.Find("NewProtocol").Text();
     if (!nRouterPort || (mapping.szProtocol != "TCP" && mapping.szProtocol != "UDP")) {
         return false;
     }
@@ -51,18 +48,11 @@ bool ReadKey(const XMLElement* pRoot, IgdEntry& mapping) {
 
 // The entries of a listing, which is a document inside the answer. Those that make no sense are left out.
 std::vector<IgdEntry> ReadListing(const SoapAnswer& answer) {
-    const XMLElement* pListing = FindElement(answer.Root(), "NewPortListing");
-    const char* szListing = pListing == nullptr ? nullptr : pListing->GetText();
-    tinyxml2::XMLDocument listing;
+    const XmlDocument listing(answer.Root().Find("NewPortListing").Raw());
     std::vector<IgdEntry> rgMappings;
-    if (szListing == nullptr || listing.Parse(szListing) != tinyxml2::XML_SUCCESS) {
-        return rgMappings;
-    }
-    const XMLElement* pEntry = listing.RootElement() == nullptr ? nullptr : listing.RootElement()->FirstChildElement();
-    for (; pEntry != nullptr; pEntry = pEntry->NextSiblingElement()) {
+    for (XmlElement entry = listing.Root().Child(); entry; entry = entry.Next()) {
         IgdEntry mapping;
-        const XMLElement* pFields = pEntry->FirstChildElement();
-        if (ReadKey(pFields, mapping) && ReadEntry(pFields, mapping)) {
+        if (ReadKey(entry, mapping) && ReadEntry(entry, mapping)) {
             rgMappings.push_back(std::move(mapping));
         }
     }

@@ -1,13 +1,9 @@
 // See Soap.h.
 #include "wire/upnp/Soap.h"
 
-#include "wire/upnp/Xml.h"
-
 namespace tavo {
 
 namespace {
-
-using tinyxml2::XMLDocument;
 
 constexpr int kLeastErrorCode = 100;  // no protocol has less, and as a status "1" is success
 constexpr char kEncoding[] = "http://schemas.xmlsoap.org/soap/encoding/";
@@ -15,43 +11,27 @@ constexpr char kEnvelope[] = "http://schemas.xmlsoap.org/soap/envelope/";
 
 // An element without a text is written with both its tags: there are routers that read no other.
 std::string Envelope(const std::string& szService, const char* szAction, const std::vector<SoapArgument>& rgArguments) {
-    const std::string szCall = std::string("u:") + szAction;
-    tinyxml2::XMLPrinter printer(nullptr, true);
-    printer.PushDeclaration("xml version=\"1.0\"");
-    printer.OpenElement("s:Envelope", true);
-    printer.PushAttribute("xmlns:s", kEnvelope);
-    printer.PushAttribute("s:encodingStyle", kEncoding);
-    printer.OpenElement("s:Body", true);
-    printer.OpenElement(szCall.c_str(), true);
-    printer.PushAttribute("xmlns:u", szService.c_str());
-    printer.PushText("");
+    std::string szXml = std::string("<?xml version=\"1.0\"?><s:Envelope xmlns:s=\"") + kEnvelope +
+                        "\" s:encodingStyle=\"" + kEncoding + "\"><s:Body><u:" + szAction + " xmlns:u=\"" +
+                        EscapedXml(szService) + "\">";
     for (const SoapArgument& argument : rgArguments) {
-        printer.OpenElement(argument.szName, true);
-        printer.PushText(argument.szValue.c_str());
-        printer.CloseElement(true);
+        szXml += std::string("<") + argument.szName + ">" + EscapedXml(argument.szValue) + "</" + argument.szName + ">";
     }
-    printer.CloseElement(true);
-    printer.CloseElement(true);
-    printer.CloseElement(true);
-    return printer.CStr();
+    return szXml + "</u:" + szAction + "></s:Body></s:Envelope>";
 }
 
-int CodeOfBody(long nHttpCode, const XMLDocument& document) {
-    const tinyxml2::XMLElement* pRoot = document.RootElement();
-    if (document.Error() || pRoot == nullptr) {
-        return kWireGarbage;
+int CodeOfBody(long nHttpCode, const XmlElement& root) {
+    if (!root.Find("Fault")) {
+        return nHttpCode == 200 && root.Find("Body").Child() ? kWireOk : kWireGarbage;
     }
-    if (FindElement(pRoot, "Fault") == nullptr) {
-        return nHttpCode == 200 && FindElement(pRoot, "Body") != nullptr ? kWireOk : kWireGarbage;
-    }
-    const auto nCode = ParseNumber<int>(TextOf(FindElement(pRoot, "errorCode")));
+    const auto nCode = ParseNumber<int>(root.Find("errorCode").Text());
     return nCode && *nCode >= kLeastErrorCode ? *nCode : kWireGarbage;
 }
 
-int CodeOf(const HttpAnswer& answer, const XMLDocument& document) {
+int CodeOf(const HttpAnswer& answer, const XmlElement& root) {
     switch (answer.enEnd) {
         case HttpEnd::kAnswered:
-            return CodeOfBody(answer.nCode, document);
+            return CodeOfBody(answer.nCode, root);
         case HttpEnd::kTimeout:
             return kWireTimeout;
         case HttpEnd::kUnreachable:
@@ -64,21 +44,8 @@ int CodeOf(const HttpAnswer& answer, const XMLDocument& document) {
 
 }  // namespace
 
-SoapAnswer::SoapAnswer(const HttpAnswer& answer) : mPDocument(std::make_unique<XMLDocument>()) {
-    mPDocument->Parse(answer.szBody.data(), answer.szBody.size());
-    mNCode = CodeOf(answer, *mPDocument);
-}
-
-SoapAnswer::~SoapAnswer() = default;
-SoapAnswer::SoapAnswer(SoapAnswer&& other) noexcept = default;
-
-const tinyxml2::XMLElement* SoapAnswer::Root() const {
-    return mPDocument->RootElement();
-}
-
-std::string SoapAnswer::Text(std::string_view szName) const {
-    return TextOf(FindElement(Root(), szName));
-}
+SoapAnswer::SoapAnswer(const HttpAnswer& answer)
+    : mDocument(answer.szBody), mNCode(CodeOf(answer, mDocument.Root())) {}
 
 SoapAnswer CallService(HttpTransport& http, const HttpUrl& control, const std::string& szService, const char* szAction,
                        const std::vector<SoapArgument>& rgArguments) {
