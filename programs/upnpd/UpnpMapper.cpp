@@ -6,6 +6,7 @@
 #include <chrono>
 #include <utility>
 
+#include "ground/SysLog.h"
 #include "programs/common/IgdRouter.h"
 #include "wire/upnp/GatewayMemory.h"
 
@@ -30,22 +31,23 @@ void UpnpMapper::NewGateway() {
     mPIgd.reset();
     mEvents.TurnTo(std::nullopt, "");
     KnownRouter known = RecallRouter(Gateway());
-    mSzLocation = std::move(known.szLocation);
+    mPlace = std::move(known.place);
     mHabit.blPermanentOnly = known.blPermanentOnly;
 }
 
 void UpnpMapper::LostRouter() {
     mPIgd.reset();
-    mSzLocation.clear();
+    mPlace = {};
 }
 
 // Where does the router's service live. False: there is none that we can use.
 bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
-        const std::string szKnown = mSzLocation;
-        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mSzLocation, 0, fnStop);
+        const IgdPlace known = mPlace;
+        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mPlace, 0, fnStop);
         if (mPIgd != nullptr) {
-            mHabit.blPermanentOnly = mHabit.blPermanentOnly && mSzLocation == szKnown;  // it may be another one
+            mHabit.blPermanentOnly = mHabit.blPermanentOnly && mPlace == known;  // it may be another one
+            mPBefore = mPIgd->Beside(known.szControl);
             mEvents.TurnTo(mPIgd->Service().events, Box());
             Remember();
         }
@@ -53,9 +55,19 @@ bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     return mPIgd != nullptr;
 }
 
+// A router with several lines may have gone over to another one.
+void UpnpMapper::ChooseLine(const std::function<bool()>& fnStop) {
+    if (mPIgd != nullptr && mPIgd->IsOneOfSeveral()) {
+        mPIgd->SetStop(fnStop);
+        if (mPIgd->IsConnected() == false) {
+            mPIgd.reset();
+        }
+    }
+}
+
 // What worked is tried first the next time, also after a restart.
 void UpnpMapper::Remember() const {
-    KeepRouter(Gateway(), {mSzLocation, mHabit.blPermanentOnly});
+    KeepRouter(Gateway(), {mPlace, mHabit.blPermanentOnly});
 }
 
 // Before the table is read: what changes after that is told.
@@ -86,6 +98,7 @@ bool UpnpMapper::HasMade(const std::function<bool()>& fnStop) {
 }
 
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
+    ChooseLine(fnStop);
     if (!FindRouter(fnStop)) {
         mMade.Get().TurnTo(Front([] { return true; }));  // nobody is there to be asked
         PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
@@ -113,6 +126,11 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         blChanged = true;
         fnLog(mapping, step);
     };
+    if (const auto pBefore = std::exchange(mPBefore, nullptr)) {
+        SysLog(LOG_NOTICE, "the router's line at %s is used now", mPIgd->Service().control.Text().c_str());
+        IgdRouter before(*pBefore);
+        BringInLine(before, {}, mMade.Get(), mHabit, around);
+    }
     PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);
     mQuietUntil = blChanged ? BootClock::now() + kEcho : mQuietUntil;
     result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;

@@ -34,11 +34,13 @@ private:
 
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember() const;
+    void ChooseLine(const std::function<bool()>& fnStop);
     void KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
-    std::string mSzLocation;
+    IgdPlace mPlace;
     std::unique_ptr<Igd> mPIgd;
+    std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
     Habits mHabit;
     MadeFile mMade;
     Events mEvents;

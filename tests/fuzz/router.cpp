@@ -191,7 +191,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* pData, size_t nSize) {
     if (!location) {
         return 0;
     }
-    const auto pIgd = tavo::Igd::At(*location, std::make_shared<FuzzedRouter>(script));
+    std::string szWhy;
+    const auto pIgd = tavo::Igd::At(*location, std::make_shared<FuzzedRouter>(script), szWhy);
+    Require((pIgd == nullptr) != szWhy.empty(), "what is refused has a reason");
     if (pIgd == nullptr) {
         return 0;
     }

@@ -27,6 +27,19 @@ using namespace std::chrono_literals;
 
 using tavo::IgdEntry;
 
+// The first service of a description.
+std::optional<tavo::IgdService> ServiceIn(const std::string& szXml, const tavo::HttpUrl& location) {
+    std::string szWhy;
+    const auto rgServices = tavo::ParseDescription(szXml, location, szWhy);
+    EXPECT_EQ(rgServices.empty(), !szWhy.empty());
+    return rgServices.empty() ? std::nullopt : std::optional(rgServices.front());
+}
+
+std::unique_ptr<tavo::Igd> IgdAt(const std::shared_ptr<tavo::HttpTransport>& pHttp) {
+    std::string szWhy;
+    return tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp, szWhy);
+}
+
 TEST(Ssdp, OnlyTheGatewayItselfCounts) {
     const std::pair<const char*, bool> rgCases[] = {
         {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", true},
@@ -60,7 +73,7 @@ TEST(Ssdp, OnlyTheGatewayItselfCounts) {
 TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     const tavo::HttpUrl location{"192.168.1.1", 80, "/dir/root.xml"};
     const auto fnControl = [&](const std::string& szControl, const std::string& szExtra) {
-        const auto service = tavo::ParseDescription("<root>" + szExtra +
+        const auto service = ServiceIn("<root>" + szExtra +
                                                         "<d><d><service><serviceType>urn:schemas-upnp-org:service:"
                                                         "WANPPPConnection:1</serviceType><controlURL>" +
                                                         szControl + "</controlURL></service></d></d></root>",
@@ -74,7 +87,7 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_EQ(fnControl("http://10.0.0.9/c", ""), "");
     EXPECT_EQ(fnControl("", ""), "");
     const auto fnEvents = [&](const std::string& szElement) {
-        const auto service = tavo::ParseDescription(
+        const auto service = ServiceIn(
             "<root><service><serviceType>urn:schemas-upnp-org:service:"
             "WANIPConnection:1</serviceType><controlURL>/c</controlURL>" +
                 szElement + "</service></root>",
@@ -91,7 +104,7 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
             szOpen += "<a>";
             szClose += "</a>";
         }
-        EXPECT_EQ(tavo::ParseDescription("<root>" + szOpen +
+        EXPECT_EQ(ServiceIn("<root>" + szOpen +
                                              "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
                                              "</serviceType><controlURL>/c</controlURL></service>" +
                                              szClose + "</root>",
@@ -104,8 +117,8 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     for (int i = 0; i < 5000; ++i) {
         szDeep += "<a>";
     }
-    EXPECT_FALSE(tavo::ParseDescription(szDeep, location));
-    EXPECT_FALSE(tavo::ParseDescription("", location));
+    EXPECT_FALSE(ServiceIn(szDeep, location));
+    EXPECT_FALSE(ServiceIn("", location));
 }
 
 // What a router says it is, and where its service is, of a description that others would not read.
@@ -143,7 +156,7 @@ TEST(Igd, BrokenDescriptionsAreReadAsFarAsTheyGo) {
         {"<!DOCTYPE r [<!ENTITY e SYSTEM '/etc/passwd'>]>" + fnDevice("M&e;"), "M"},
         {fnDevice("M", "<a" + szAttributes + "/>"), "none"}};
     for (const auto& [szXml, szModel] : rgCases) {
-        const auto service = tavo::ParseDescription(szXml, {"192.168.1.1", 80, "/"});
+        const auto service = ServiceIn(szXml, {"192.168.1.1", 80, "/"});
         EXPECT_EQ(service ? service->model.szModel : "none", szModel) << szXml.substr(0, 300);
         EXPECT_EQ(service ? service->control.Text() : "http://192.168.1.1:80/c", "http://192.168.1.1:80/c");
     }
@@ -156,7 +169,7 @@ TEST(Igd, ARouterIsWhatItsRootDeviceSaysInOneHarmlessText) {
                                   "<serviceList><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
                                   "</serviceType><controlURL>/c</controlURL></service></serviceList></device>"
                                   "</deviceList></u:device></u:root>";
-        const auto service = tavo::ParseDescription(szXml, {"192.168.1.1", 80, "/"});
+        const auto service = ServiceIn(szXml, {"192.168.1.1", 80, "/"});
         return service ? service->model.szBrand + "|" + service->model.szModel + "|" + service->model.szVersion : "-";
     };
     const std::string szNumber = "<modelNumber>1</modelNumber>";
@@ -240,7 +253,7 @@ public:
 
 TEST(Igd, WhatIsAskedIsXmlWhateverATextHolds) {
     const auto pRouter = std::make_shared<Canned>();
-    const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pRouter);
+    const auto pIgd = IgdAt(pRouter);
     ASSERT_NE(pIgd, nullptr);
     tavo::IgdEntry entry{"TCP", 5001, 8080, "192.168.1.5", "a</NewEnabled>&\"b'", 60, true};
     EXPECT_EQ(pIgd->Add(entry), tavo::kWireOk);
@@ -276,14 +289,82 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
         const auto pHttp = std::make_shared<Canned>();
         pHttp->mSzAnswer = szAnswer;
         std::vector<IgdEntry> rgMappings;
-        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->ListRange("TCP", 1, 9, rgMappings), 0) << szAnswer;
+        EXPECT_EQ(IgdAt(pHttp)->ListRange("TCP", 1, 9, rgMappings), 0) << szAnswer;
         EXPECT_EQ(rgMappings.size(), nExpected) << szAnswer;
     }
     const auto pFirst = std::make_shared<Canned>();
     pFirst->mSzVersion = "1";  // the first generation knows no ranges: it is not even asked
     std::vector<IgdEntry> rgMappings;
-    EXPECT_NE(tavo::Igd::At({"192.168.1.1", 80, "/"}, pFirst)->ListRange("TCP", 1, 9, rgMappings), 0);
+    EXPECT_NE(IgdAt(pFirst)->ListRange("TCP", 1, 9, rgMappings), 0);
     EXPECT_EQ(pFirst->mNPosts, 0);
+}
+
+// A router with a line each at /1, /2 and so on: its state and its address; "?" where it does not say.
+class Lines : public tavo::HttpTransport {
+public:
+    using Line = std::pair<std::string, std::string>;
+    explicit Lines(std::vector<Line> rgLines) : mRgLines(std::move(rgLines)) {}
+    tavo::HttpAnswer Get(const tavo::HttpUrl&) override {
+        std::string szXml = "<root>";
+        for (size_t i = 1; i <= mRgLines.size(); ++i) {
+            szXml += std::string("<device><service><serviceType>urn:") + (i % 2 == 0 ? "dslforum" : "schemas-upnp") +
+                     "-org:service:WANPPPConnection:1</serviceType><controlURL>/" + std::to_string(i) +
+                     "</controlURL></service></device>";
+        }
+        return {tavo::HttpEnd::kAnswered, 200, szXml + "</root>"};
+    }
+    tavo::HttpAnswer Post(const tavo::HttpUrl& url, const std::vector<std::string>&,
+                          const std::string& szBody) override {
+        ++mNPosts;
+        const auto& [szState, szAddress] = mRgLines.at(std::stoul(url.szPath.substr(1)) - 1);
+        const bool blState = szBody.find("GetStatusInfo") != std::string::npos;
+        const std::string& szText = blState ? szState : szAddress;
+        const std::string szName = blState ? "NewConnectionStatus" : "NewExternalIPAddress";
+        return szText == "?" ? Canned::Fault(401) : Canned::Said("<" + szName + ">" + szText + "</" + szName + ">");
+    }
+    int mNPosts = 0;
+
+private:
+    std::vector<Line> mRgLines;
+};
+
+TEST(Igd, OfSeveralLinesTheOneThatIsUpIsUsed) {
+    const Lines::Line down{"Disconnected", "0.0.0.0"};
+    const Lines::Line mute{"?", "?"};
+    const Lines::Line inside{"Connected", "100.64.0.9"};
+    const Lines::Line outside{"Connected", "198.41.0.4"};
+    const Lines::Line none{"Connected", ""};
+    struct Case {
+        std::vector<Lines::Line> rgLines;
+        const char* szKnown;
+        const char* szUsed;
+        int nPosts;
+    };
+    const Case rgCases[] = {{{down}, "", "/1", 0},  // there is nothing to choose
+                            {{down, outside}, "", "/2", 4},
+                            {{outside, down}, "", "/1", 4},
+                            {{inside, outside}, "", "/2", 4},
+                            {{none, inside}, "", "/2", 4},
+                            {{mute, none}, "", "/2", 4},
+                            {{down, mute}, "", "/2", 4},
+                            {{mute, mute}, "", "/1", 4},
+                            {{{"Disconnected", "198.41.0.4"}, none}, "", "/2", 4},
+                            {{{"?", "198.41.0.4"}, {"?", "10.0.0.4"}}, "", "/1", 4},
+                            {{inside, outside}, "http://192.168.1.1:80/1", "/1", 1},
+                            {{outside, inside}, "http://192.168.1.1:80/2", "/2", 3},
+                            {{down, inside}, "http://192.168.1.1:80/1", "/2", 4},
+                            {{inside, outside}, "http://192.168.1.1:80/9", "/2", 4}};
+    for (const Case& one : rgCases) {
+        const auto pLines = std::make_shared<Lines>(one.rgLines);
+        std::string szWhy;
+        const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pLines, szWhy, one.szKnown);
+        EXPECT_EQ(pIgd->Service().control.szPath, one.szUsed) << &one - rgCases;
+        EXPECT_EQ(pLines->mNPosts, one.nPosts) << &one - rgCases;
+        EXPECT_EQ(pIgd->IsOneOfSeveral(), one.rgLines.size() > 1);
+        const auto pFirst = pIgd->Beside("http://192.168.1.1:80/1");
+        EXPECT_EQ(pFirst != nullptr, one.szUsed != std::string("/1"));
+        EXPECT_TRUE(pFirst == nullptr || pFirst->Service().control.szPath == "/1");
+    }
 }
 
 // A table of which each index shows the next of these entries.
@@ -319,7 +400,7 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
         const auto pHttp = std::make_shared<Table>();
         pHttp->mRgEntries = rgEntries;
         std::vector<IgdEntry> rgMappings;
-        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->List(rgMappings), nCode);
+        EXPECT_EQ(IgdAt(pHttp)->List(rgMappings), nCode);
         EXPECT_EQ(rgMappings.size(), nShown);
         EXPECT_EQ(rgMappings.at(0).szClient, szOne);
     }
@@ -347,14 +428,14 @@ TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
         pHttp->mNEnd = one.nEnd;
         pHttp->mNSeconds = one.nSeconds;
         std::vector<IgdEntry> rgMappings;
-        EXPECT_EQ(tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp)->List(rgMappings), one.nCode) << &one - rgCases;
+        EXPECT_EQ(IgdAt(pHttp)->List(rgMappings), one.nCode) << &one - rgCases;
         EXPECT_EQ(rgMappings.size(), one.nShown) << &one - rgCases;
     }
 }
 
 TEST(Igd, WhatAnEntryAndAnAddressSay) {
     const auto pHttp = std::make_shared<Canned>();
-    const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp);
+    const auto pIgd = IgdAt(pHttp);
     const auto fnTag = [](const char* szName, const char* szText) {
         return std::string("<") + szName + ">" + szText + "</" + szName + ">";
     };
@@ -586,8 +667,8 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         "HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(szXml.size()) + "\r\n\r\n" + szXml;
     for (const char* szHost : {kGateway, kBox}) {
         WebServer server(szPage, szHost);
-        std::string szPlace = std::string("http://") + szHost + ":" + std::to_string(server.Port()) + "/x";
-        const auto pIgd = tavo::Igd::Find(kGateway, kBox, 300, &szPlace, 0);
+        tavo::IgdPlace place{std::string("http://") + szHost + ":" + std::to_string(server.Port()) + "/x", ""};
+        const auto pIgd = tavo::Igd::Find(kGateway, kBox, 300, &place, 0);
         EXPECT_EQ(pIgd != nullptr, szHost == kGateway) << szHost;
         if (pIgd == nullptr) {
             tavo::HttpClient().Get({szHost, server.Port(), "/nobody"});
@@ -599,13 +680,13 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         gSzGateway = kGateway;
         WebServer server(szPage, kGateway);
         const std::string szKnown = "http://192.168.77.1:" + std::to_string(server.Port()) + "/x";
-        tavo::KeepRouter(kGateway, {szKnown, true});
+        tavo::KeepRouter(kGateway, {{szKnown, ""}, true});
         std::string szLocal;
         EXPECT_NE(tavo::FindGatewayIgd(300, 0, &szLocal, {}), nullptr);
         EXPECT_TRUE(szLocal.starts_with("192.168.77.")) << szLocal;
-        EXPECT_EQ(tavo::RecallRouter(kGateway).szLocation, szKnown);
+        EXPECT_EQ(tavo::RecallRouter(kGateway).place.szLocation, szKnown);
         EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
-        tavo::KeepRouter(kGateway, {"", false});
+        tavo::KeepRouter(kGateway, {});
         EXPECT_EQ(tavo::FindGatewayIgd(100, 0, nullptr, {}), nullptr);
         gSzGateway = "";
         EXPECT_EQ(tavo::FindGatewayIgd(30000, 0, nullptr, {}), nullptr);
@@ -622,12 +703,12 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         }
     });
     gSzGateway = kGateway;
-    tavo::KeepRouter(kGateway, {"http://192.168.77.1:1/gone", true});
+    tavo::KeepRouter(kGateway, {{"http://192.168.77.1:1/gone", ""}, true});
     EXPECT_NE(tavo::FindGatewayIgd(5000, 0, nullptr, {}), nullptr);
     blEnd = true;
     gateway.join();
     gSzGateway = "192.168.1.1";
-    EXPECT_TRUE(tavo::RecallRouter(kGateway).szLocation.ends_with("/found")) << "what is found is kept";
+    EXPECT_TRUE(tavo::RecallRouter(kGateway).place.szLocation.ends_with("/found")) << "what is found is kept";
     EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
 }
 

@@ -310,13 +310,13 @@ const std::vector<Store>& Stores() {
          KeptTest, "old", "new"},
         {"a known router",
          [] {
-             tavo::KeepRouter("192.168.1.1", {"old", false});
+             tavo::KeepRouter("192.168.1.1", {{"old", ""}, false});
          },
          [] {
-             tavo::KeepRouter("192.168.1.1", {"new", false});
+             tavo::KeepRouter("192.168.1.1", {{"new", ""}, false});
              return true;
          },
-         [] { return tavo::RecallRouter("192.168.1.1").szLocation; }, "old", "new", "", true},
+         [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old", "new", "", true},
         {"a task", [] { StoreTask("old"); }, [] { return StoreTask("new"); }, StoredTask, "old", "new"},
         {"the first task", [] {}, [] { return StoreTask("new"); }, StoredTask, kNone, "new"},
         {"a draft", [] { WriteDraft("old"); }, [] { return WriteDraft("new"); }, ReadDraft, "old", "new"},

@@ -1,8 +1,10 @@
 // See Description.h.
 #include "wire/upnp/Description.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
+#include <iterator>
 
 #include "ground/TextFile.h"
 #include "wire/upnp/Xml.h"
@@ -10,6 +12,12 @@
 namespace tavo {
 
 namespace {
+
+// In any generation; the last two are those of the DSL Forum, older than the others.
+constexpr const char* kTypes[] = {
+    "urn:schemas-upnp-org:service:WANIPConnection:", "urn:schemas-upnp-org:service:WANPPPConnection:",
+    "urn:dslforum-org:service:WANIPConnection:", "urn:dslforum-org:service:WANPPPConnection:"};
+constexpr size_t kMostServices = 8;
 
 // A mark of a text that is too long to be kept (32-bit FNV-1a).
 std::string MarkOf(std::string_view szText) {
@@ -42,21 +50,17 @@ std::string ModelText(const XmlElement& device, std::string_view szName) {
 }
 
 bool MapsPorts(const std::string& szType) {
-    return szType.starts_with("urn:schemas-upnp-org:service:WANIPConnection:") ||
-           szType.starts_with("urn:schemas-upnp-org:service:WANPPPConnection:");
+    return std::any_of(std::begin(kTypes), std::end(kTypes), [&](const char* szKind) { return szType.starts_with(szKind); });
 }
 
-// The first service below an element that maps ports.
-XmlElement FindService(const XmlElement& element, int nDepth = 1) {
+// The services below an element that map ports.
+void FindServices(const XmlElement& element, std::vector<XmlElement>& rgServices, int nDepth = 1) {
     for (XmlElement child = nDepth < kMaxXmlDepth ? element.Child() : XmlElement(); child; child = child.Next()) {
         if (child.Name() == "service" && MapsPorts(child.Child("serviceType").Text())) {
-            return child;
+            rgServices.push_back(child);
         }
-        if (const XmlElement found = FindService(child, nDepth + 1)) {
-            return found;
-        }
+        FindServices(child, rgServices, nDepth + 1);
     }
-    return {};
 }
 
 IgdModel ReadModel(const XmlElement& root) {
@@ -91,22 +95,31 @@ std::optional<HttpUrl> ResolveAddress(const std::string& szAddress, const std::s
 
 }  // namespace
 
-std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location) {
+std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location, std::string& szWhy) {
     const XmlDocument document(szXml);
-    const XmlElement service = FindService(document.Root());
-    if (!service) {
-        return std::nullopt;
+    const XmlElement root = document.Root();
+    std::vector<XmlElement> rgElements;
+    FindServices(root, rgElements);
+    const std::string szBase = root.Child("URLBase").Text();
+    const IgdModel model = ReadModel(root);
+    std::vector<IgdService> rgServices;
+    for (const XmlElement& element : rgElements) {
+        const auto fnResolve = [&](const char* szName) {
+            return ResolveAddress(element.Child(szName).Text(), szBase, location);
+        };
+        const auto control = fnResolve("controlURL");
+        const bool blKnown = std::any_of(rgServices.begin(), rgServices.end(), [&](const IgdService& service) {
+            return control && service.control.Text() == control->Text();
+        });
+        if (control && !blKnown && rgServices.size() < kMostServices) {
+            rgServices.push_back({element.Child("serviceType").Text(), *control, fnResolve("eventSubURL"), model});
+        }
     }
-    const std::string szBase = document.Root().Child("URLBase").Text();
-    const auto fnResolve = [&](const char* szName) {
-        return ResolveAddress(service.Child(szName).Text(), szBase, location);
-    };
-    const auto control = fnResolve("controlURL");
-    if (!control) {
-        return std::nullopt;
-    }
-    return IgdService{service.Child("serviceType").Text(), *control, fnResolve("eventSubURL"),
-                      ReadModel(document.Root())};
+    szWhy = !rgServices.empty()   ? ""
+            : !root               ? "it cannot be read"
+            : rgElements.empty() ? "it has no service that maps ports"
+                                  : "its service is not on the gateway";
+    return rgServices;
 }
 
 }  // namespace tavo

@@ -4,6 +4,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "wire/http/Http.h"
 
@@ -25,7 +26,8 @@ struct IgdService {
     std::optional<HttpUrl> events;  // where it takes subscriptions; nothing where it tells nothing
     IgdModel model;
 };
-// Nothing when the description is unreadable, offers none, or sends us to another host.
-std::optional<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location);
+// Those of a description, in its order, each place once, and the first few: a router has a service for each line, of
+// which one may be dead. None when it is unreadable, has none, or sends us to another host; szWhy says which.
+std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location, std::string& szWhy);
 
 }  // namespace tavo

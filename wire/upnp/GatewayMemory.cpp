@@ -27,17 +27,18 @@ std::string StateOf(const std::string& szGateway, const char* szKey) {
 }  // namespace
 
 KnownRouter RecallRouter(const std::string& szGateway) {
-    return {StateOf(szGateway, "location"), StateOf(szGateway, "permanent") == "yes"};
+    return {{StateOf(szGateway, "location"), StateOf(szGateway, "service")}, StateOf(szGateway, "permanent") == "yes"};
 }
 
 void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     const KnownRouter before = RecallRouter(szGateway);
-    if (before.szLocation == router.szLocation && before.blPermanentOnly == router.blPermanentOnly) {
+    if (before.place == router.place && before.blPermanentOnly == router.blPermanentOnly) {
         return;
     }
     MakeDirectory(kStateDir);
-    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(2), &TLIBCSzHashFree);
-    TLIBCSzHashSetValue(pHash.get(), "location", router.szLocation.c_str());
+    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(3), &TLIBCSzHashFree);
+    TLIBCSzHashSetValue(pHash.get(), "location", router.place.szLocation.c_str());
+    TLIBCSzHashSetValue(pHash.get(), "service", router.place.szControl.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
     if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
         SysLog(LOG_WARNING, "cannot write %s", kStateFile);
@@ -53,7 +54,7 @@ std::unique_ptr<Igd> FindGatewayIgd(int nLimitMilliseconds, int nLocalPort, std:
         return nullptr;
     }
     KnownRouter known = RecallRouter(szGateway);
-    auto pIgd = Igd::Find(szGateway, szLocal, nLimitMilliseconds, &known.szLocation, nLocalPort, fnStop);
+    auto pIgd = Igd::Find(szGateway, szLocal, nLimitMilliseconds, &known.place, nLocalPort, fnStop);
     if (pSzLocal != nullptr) {
         *pSzLocal = szLocal;
     }

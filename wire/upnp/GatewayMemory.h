@@ -11,7 +11,7 @@
 namespace tavo {
 
 struct KnownRouter {
-    std::string szLocation;  // where its description was last found
+    IgdPlace place;  // where its service was last found
     bool blPermanentOnly = false;
 };
 

@@ -3,9 +3,13 @@
 
 #include <arpa/inet.h>
 
+#include <algorithm>
 #include <chrono>
+#include <iterator>
 #include <map>
 
+#include "ground/SysLog.h"
+#include "ground/net/Level.h"
 #include "wire/upnp/Search.h"
 #include "wire/upnp/Soap.h"
 
@@ -15,6 +19,9 @@ namespace {
 
 constexpr int kMaxEntries = 65536;
 constexpr auto kListLimit = std::chrono::seconds(8);  // then who asks goes on by name
+
+constexpr int kRanksOfAddress = 3;
+constexpr int kBestRank = 3 * kRanksOfAddress;  // of one that is known
 
 bool IsAddress(const std::string& szText) {
     in_addr address = {};
@@ -66,17 +73,39 @@ std::vector<SoapArgument> Key(const std::string& szProtocol, uint16_t nRouterPor
 
 }  // namespace
 
-std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp) {
+std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp, std::string& szWhy,
+                             const std::string& szKnown) {
     const HttpAnswer answer = pHttp->Get(location);
     if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
+        szWhy = answer.enEnd == HttpEnd::kAnswered   ? "HTTP status " + std::to_string(answer.nCode)
+                : answer.enEnd == HttpEnd::kTimeout ? "no answer in time"
+                                                    : "no answer that makes sense";
         return nullptr;
     }
-    auto service = ParseDescription(answer.szBody, location);
-    return service ? std::unique_ptr<Igd>(new Igd(std::move(*service), std::move(pHttp))) : nullptr;
+    const std::vector<IgdService> rgServices = ParseDescription(answer.szBody, location, szWhy);
+    std::unique_ptr<Igd> pBest;
+    int nBest = -1;
+    for (size_t i = 0; i < rgServices.size() && nBest < kBestRank; ++i) {
+        std::unique_ptr<Igd> pIgd(new Igd(rgServices[i], pHttp));
+        std::copy_if(rgServices.begin(), rgServices.end(), std::back_inserter(pIgd->mRgBeside),
+                     [&](const IgdService& service) { return &service != &rgServices[i]; });
+        const int nRank = pIgd->IsOneOfSeveral() ? pIgd->Rank(szKnown) : kBestRank;
+        if (nRank > nBest) {
+            nBest = nRank;
+            pBest = std::move(pIgd);
+        }
+    }
+    return pBest;
+}
+
+std::unique_ptr<Igd> Igd::Beside(const std::string& szControl) const {
+    const auto it = std::find_if(mRgBeside.begin(), mRgBeside.end(),
+                                 [&](const IgdService& service) { return service.control.Text() == szControl; });
+    return it == mRgBeside.end() ? nullptr : std::unique_ptr<Igd>(new Igd(*it, mPHttp));
 }
 
 std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                               std::string* pSzLocation, int nLocalPort, const std::function<bool()>& fnStop) {
+                               IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop) {
     std::unique_ptr<Igd> pFound;
     const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(nLimitMilliseconds);
     const auto fnLeft = [&] {
@@ -87,15 +116,18 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
         const auto pHttp = std::make_shared<HttpClient>();
         pHttp->SetStop(fnStop);
         pHttp->SetLimit(nLimit);
-        pFound = At(location, pHttp);
+        std::string szWhy;
+        pFound = At(location, pHttp, szWhy, pPlace == nullptr ? "" : pPlace->szControl);
         pHttp->SetLimit(kRequestMilliseconds);
-        if (pFound != nullptr && pSzLocation != nullptr) {
-            *pSzLocation = location.Text();
+        if (pFound == nullptr) {
+            SysLog(LOG_WARNING, "router's description at %s is of no use: %s", location.Text().c_str(), szWhy.c_str());
+        } else if (pPlace != nullptr) {
+            *pPlace = {location.Text(), pFound->IsOneOfSeveral() ? pFound->Service().control.Text() : ""};
         }
         return pFound != nullptr;
     };
-    if (pSzLocation != nullptr && !pSzLocation->empty()) {
-        const auto known = ParseHttpUrl(*pSzLocation);
+    if (pPlace != nullptr && !pPlace->szLocation.empty()) {
+        const auto known = ParseHttpUrl(pPlace->szLocation);
         if (known && known->szHost == szGateway && fnTry(*known, nLimitMilliseconds / 2)) {
             return pFound;
         }
@@ -121,6 +153,28 @@ int Igd::GetAt(int nIndex, IgdEntry& mapping) {
     }
     mapping = std::move(read);
     return kWireOk;
+}
+
+std::optional<bool> Igd::IsConnected() {
+    const SoapAnswer answer = Call("GetStatusInfo", {});
+    const std::string szStatus = answer.Text("NewConnectionStatus");
+    return answer.IsOk() && !szStatus.empty() ? std::optional(szStatus == "Connected") : std::nullopt;
+}
+
+// The line first, then the address. The one that is known stays for as long as its line is up: a change of it closes
+// what is open.
+int Igd::Rank(const std::string& szKnown) {
+    const std::optional<bool> blConnected = IsConnected();
+    if (blConnected == true && mService.control.Text() == szKnown) {
+        return kBestRank;
+    }
+    std::string szAddress;
+    in_addr address = {};
+    const bool blAddress =
+        ExternalAddress(szAddress) == kWireOk && inet_pton(AF_INET, szAddress.c_str(), &address) == 1;
+    const AddressKind enKind = blAddress ? KindOf(address) : AddressKind::kNone;
+    const int nAddress = enKind == AddressKind::kPublic ? 2 : enKind == AddressKind::kNone ? 0 : 1;
+    return (!blConnected ? 1 : *blConnected ? 2 : 0) * kRanksOfAddress + nAddress;
 }
 
 int Igd::ExternalAddress(std::string& szAddress) {

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -38,19 +39,29 @@ enum IgdCode : int {
     kIgdOnlyPermanentLeases = 725
 };
 
+// Where a gateway's service was found; empty texts: nowhere yet.
+struct IgdPlace {
+    std::string szLocation;  // of the description
+    std::string szControl;   // of the service, where the description has several
+
+    bool operator==(const IgdPlace& other) const = default;
+};
+
 // Every call answers a WireCode, or the protocol's own code. Outputs are set only with kWireOk; with kWireTooLong,
 // List() has what was read.
 class Igd {
 public:
     // The IGD at the gateway, found within the limit or not at all. A description is waited for as long as
     // half of what is left of the limit, so that one that never comes does not keep the others from being
-    // tried. pSzLocation (may be null) is tried first, and set to what worked. A search lasts as SearchGateway says.
+    // tried. pPlace (may be null) is tried first, and set to what worked. A search lasts as SearchGateway says.
     // fnStop is kept for the calls that follow.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                                     std::string* pSzLocation, int nLocalPort,
-                                     const std::function<bool()>& fnStop = {});
-    // The IGD whose description is at a location; null when there is none.
-    static std::unique_ptr<Igd> At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp);
+                                     IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop = {});
+    // The IGD whose description is at a location; null when there is none, and szWhy says what there is. Of several
+    // services the one that is connected, with a public address before any other and with one before none; szKnown,
+    // the control address of one of them, is that one for as long as it is connected.
+    static std::unique_ptr<Igd> At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp, std::string& szWhy,
+                                   const std::string& szKnown = "");
 
     // The most that one call may take from now on.
     void SetCallLimit(int nMilliseconds) { mPHttp->SetLimit(nMilliseconds); }
@@ -58,6 +69,8 @@ public:
     void SetStop(const std::function<bool()>& fnStop) { mPHttp->SetStop(fnStop); }
     // The entry at an index. One that makes no sense comes back disabled and without a protocol.
     int GetAt(int nIndex, IgdEntry& mapping);
+    // Whether its line is up, as far as the router says; nothing: it does not.
+    std::optional<bool> IsConnected();
     // The router's address on its other side, as it says itself.
     int ExternalAddress(std::string& szAddress);
     int List(std::vector<IgdEntry>& rgMappings);
@@ -69,13 +82,19 @@ public:
     int Remove(const std::string& szProtocol, uint16_t nRouterPort);
 
     const IgdService& Service() const { return mService; }
+    // The description has others beside it.
+    bool IsOneOfSeveral() const { return !mRgBeside.empty(); }
+    // That of them which is controlled at an address; null: none is.
+    std::unique_ptr<Igd> Beside(const std::string& szControl) const;
 
 private:
     Igd(IgdService service, std::shared_ptr<HttpTransport> pHttp)
         : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")), mPHttp(std::move(pHttp)) {}
+    int Rank(const std::string& szKnown);
     SoapAnswer Call(const char* szAction, const std::vector<SoapArgument>& rgArguments);
 
     IgdService mService;
+    std::vector<IgdService> mRgBeside;
     bool mBlRanges;  // services of the second generation show ranges, unless they once could not
     std::shared_ptr<HttpTransport> mPHttp;
 };
