@@ -9,6 +9,7 @@
 #include "ground/SysLog.h"
 #include "programs/common/IgdRouter.h"
 #include "wire/upnp/GatewayMemory.h"
+#include "wire/upnp/Search.h"
 
 namespace tavo {
 
@@ -44,8 +45,9 @@ void UpnpMapper::LostRouter() {
 bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
         const IgdPlace known = mPlace;
-        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mPlace, 0, fnStop);
+        mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mPlace, 0, fnStop, &mFdLate);
         if (mPIgd != nullptr) {
+            mFdLate.Reset();
             mHabit.blPermanentOnly = mHabit.blPermanentOnly && mPlace == known;  // it may be another one
             mPBefore = mPIgd->Beside(known.szControl);
             mEvents.TurnTo(mPIgd->Service().events, Box());
@@ -84,11 +86,18 @@ std::vector<int> UpnpMapper::WakeFds() const {
     for (const int fd : mEvents.Fds()) {
         rgFds.push_back(fd);
     }
+    if (mFdLate.Get() >= 0) {
+        rgFds.push_back(mFdLate.Get());
+    }
     return rgFds;
 }
 
 bool UpnpMapper::OnWake() {
-    const bool blRouter = RuleMapper::OnWake();
+    bool blRouter = RuleMapper::OnWake();
+    if (const auto late = TakeLate(mFdLate, Gateway())) {
+        mPlace = {late->Text(), ""};
+        blRouter = true;
+    }
     return (mEvents.TakeNews() && BootClock::now() >= mQuietUntil) || blRouter;
 }
 

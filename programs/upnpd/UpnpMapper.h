@@ -41,6 +41,7 @@ private:
     IgdPlace mPlace;
     std::unique_ptr<Igd> mPIgd;
     std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
+    Descriptor mFdLate;  // where nothing was found, what comes later is heard
     Habits mHabit;
     MadeFile mMade;
     Events mEvents;

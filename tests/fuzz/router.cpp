@@ -186,7 +186,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* pData, size_t nSize) {
     ++gReach.nInputs;
     Script script({reinterpret_cast<const char*>(pData), nSize});
     std::string szReason;
-    const auto location = tavo::LocationOf(script.Next(), kGateway, szReason);
+    const auto location = tavo::LocationOf(script.Next(), kGateway, true, szReason);
     RequirePrintable(szReason);
     if (!location) {
         return 0;

@@ -40,37 +40,48 @@ std::unique_ptr<tavo::Igd> IgdAt(const std::shared_ptr<tavo::HttpTransport>& pHt
     return tavo::Igd::At({"192.168.1.1", 80, "/"}, pHttp, szWhy);
 }
 
-TEST(Ssdp, OnlyTheGatewayItselfCounts) {
-    const std::pair<const char*, bool> rgCases[] = {
-        {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", true},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.2:5000/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:0/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:-1/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:65536/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:99999999999999999999/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1:/x\r\n\r\n", true},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://[::ffff:192.168.1.1]/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1.evil/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://192.168.1.1@evil/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: http://a:b@192.168.1.1/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: https://192.168.1.1/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\nLOCATION: file:///etc/passwd\r\n\r\n", false},
-        {"HTTP/1.1 404 No\r\nLOCATION: http://192.168.1.1/x\r\n\r\n", false},
-        {"HTTP/1.1 200 OK\r\n\r\n", false},
-        {"", false}};
-    for (const auto& [szAnswer, blGood] : rgCases) {
-        std::string szReason;
-        EXPECT_EQ(tavo::LocationOf(szAnswer, "192.168.1.1", szReason).has_value(), blGood) << szAnswer;
-        EXPECT_EQ(szReason.empty(), blGood);
+TEST(Ssdp, AnAnswerLeadsToTheGatewayOrNowhere) {
+    const auto fnAt = [](const std::string& szPlace) { return "HTTP/1.1 200 OK\r\nLOCATION: " + szPlace + "\r\n\r\n"; };
+    struct Case {
+        std::string szAnswer;
+        const char* szPlace;        // of the gateway's answer; empty: it leads nowhere
+        bool blAnybodys = false;  // it would count from another address, too
+    };
+    const Case rgCases[] = {
+        {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", "http://192.168.1.1:5000/x", true},
+        {fnAt("http://192.168.1.1:/x"), "http://192.168.1.1:80/x", true},
+        {fnAt("http://192.168.1.2:5000/x?y"), "http://192.168.1.1:5000/x?y"},
+        {fnAt("http://router.lan/x"), "http://192.168.1.1:80/x"},
+        {fnAt("http://192.168.1.1.evil/x"), "http://192.168.1.1:80/x"},
+        {fnAt("http://127.0.0.1:99/x"), "http://192.168.1.1:99/x"},
+        {fnAt("http://[::ffff:192.168.1.1]/x"), "http://192.168.1.1:80/x"},
+        {fnAt("http://192.168.1.1:0/x"), ""},
+        {fnAt("http://192.168.1.1:-1/x"), ""},
+        {fnAt("http://192.168.1.1:65536/x"), ""},
+        {fnAt("http://192.168.1.1:99999999999999999999/x"), ""},
+        {fnAt("http://192.168.1.1@evil/x"), ""},
+        {fnAt("http://a:b@192.168.1.1/x"), ""},
+        {fnAt("https://192.168.1.1/x"), ""},
+        {fnAt("file:///etc/passwd"), ""},
+        {"HTTP/1.1 404 No\r\nLOCATION: http://192.168.1.1/x\r\n\r\n", ""},
+        {"HTTP/1.1 200 OK\r\n\r\n", ""},
+        {"", ""}};
+    for (const Case& one : rgCases) {
+        for (const bool blGateway : {true, false}) {
+            std::string szReason;
+            const auto place = tavo::LocationOf(one.szAnswer, "192.168.1.1", blGateway, szReason);
+            EXPECT_EQ(place ? place->Text() : "", blGateway || one.blAnybodys ? one.szPlace : "") << one.szAnswer;
+            EXPECT_EQ(szReason.empty(), place.has_value());
+        }
     }
     for (const char* szOwn : {"127.0.0.1", "169.254.1.1"}) {
         std::string szReason;
         const std::string szAnswer = std::string("HTTP/1.1 200 OK\r\nLOCATION: http://") + szOwn + "/x\r\n\r\n";
-        EXPECT_FALSE(tavo::LocationOf(szAnswer, szOwn, szReason));
+        EXPECT_FALSE(tavo::LocationOf(szAnswer, szOwn, true, szReason));
     }
 }
 
-TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
+TEST(Igd, DescriptionsLeadToTheGateway) {
     const tavo::HttpUrl location{"192.168.1.1", 80, "/dir/root.xml"};
     const auto fnControl = [&](const std::string& szControl, const std::string& szExtra) {
         const auto service = ServiceIn("<root>" + szExtra +
@@ -84,7 +95,8 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
     EXPECT_EQ(fnControl("ctl", ""), "http://192.168.1.1:80/dir/ctl");
     EXPECT_EQ(fnControl("/c", "<URLBase>http://192.168.1.1:99/</URLBase>"), "http://192.168.1.1:99/c");
     EXPECT_EQ(fnControl("/c", "<URLBase>http://10.0.0.9/</URLBase>"), "http://192.168.1.1:80/c");
-    EXPECT_EQ(fnControl("http://10.0.0.9/c", ""), "");
+    EXPECT_EQ(fnControl("http://10.0.0.9:8/c", ""), "http://192.168.1.1:8/c");
+    EXPECT_EQ(fnControl("http://x:y@192.168.1.1/c", ""), "");
     EXPECT_EQ(fnControl("", ""), "");
     const auto fnEvents = [&](const std::string& szElement) {
         const auto service = ServiceIn(
@@ -95,7 +107,7 @@ TEST(Igd, DescriptionsLeadToTheGatewayOrNowhere) {
         return service && service->events ? service->events->Text() : "";
     };
     EXPECT_EQ(fnEvents("<eventSubURL>evt</eventSubURL>"), "http://192.168.1.1:80/dir/evt");
-    EXPECT_EQ(fnEvents("<eventSubURL>http://10.0.0.9/e</eventSubURL>"), "");
+    EXPECT_EQ(fnEvents("<eventSubURL>http://10.0.0.9:8/e</eventSubURL>"), "http://192.168.1.1:8/e");
     EXPECT_EQ(fnEvents("<eventSubURL/>"), "");
     EXPECT_EQ(fnEvents(""), "");
     for (const int nDepth : {10, 11}) {  // of the service's own elements, twelve with their root and their service
@@ -558,14 +570,14 @@ protected:
 };
 
 TEST_F(SearchTest, AsksForEachKindAgainAndAgainUntilItsLimit) {
-    for (const auto& [nMilliseconds, nAskings] : {std::pair(100, 1U), {400, 2U}, {1100, 3U}}) {
+    for (const auto& [nMilliseconds, nQuestions, nKinds] : {std::tuple(100, 4U, 4U), {280, 8U, 4U}, {900, 17U, 9U}}) {
         mRgszTargets.clear();
         const auto start = std::chrono::steady_clock::now();
         EXPECT_FALSE(Search(nMilliseconds, [this] { Hear(); }));
         const auto took = std::chrono::steady_clock::now() - start;
         EXPECT_TRUE(took >= nMilliseconds * 1ms && took < nMilliseconds * 1ms + 2s) << took / 1ms;
-        EXPECT_EQ(mRgszTargets.size(), 4 * nAskings) << nMilliseconds;
-        EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), 4U);
+        EXPECT_EQ(mRgszTargets.size(), nQuestions) << nMilliseconds;
+        EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), nKinds);
     }
     mBlStop = true;
     EXPECT_FALSE(Search(30000, [] {}));
@@ -576,15 +588,15 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
     bool blSaid = false;
     const auto fnTalk = [&] {
         if (Hear() && !std::exchange(blSaid, true)) {
-            Say(fdNeighbour, Answer("/neighbour"));
-            Say(Answer("/other", kBox));
+            Say(fdNeighbour, Answer("/neighbour", kBox));
             Say(Answer("/a"));
             Say(Answer("/a"));
-            Say(Answer("/b"));
+            Say(Answer("/b", kBox));
+            Say(fdNeighbour, Answer("/c"));
         }
     };
-    EXPECT_FALSE(Search(300, fnTalk));
-    EXPECT_EQ(mRgszTried, (std::vector<std::string>{"/a", "/b"}));
+    EXPECT_FALSE(Search(290, fnTalk));
+    EXPECT_EQ(mRgszTried, (std::vector<std::string>{"/a", "/b", "/c"}));
     blSaid = false;
     EXPECT_TRUE(Search(30000, fnTalk, 50123, true));
     EXPECT_EQ(mRgszTried, std::vector<std::string>{"/a"});
@@ -604,22 +616,45 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
     EXPECT_EQ(gLog.size(), 8U) << "and the log is not filled";
 }
 
-// The last of five questions is asked after three seconds, and silence believed after three more.
-TEST_F(SearchTest, IsOverThreeSecondsAfterTheLastWord) {
+// Where nothing is heard it is over after two seconds and a half, else after three of silence.
+TEST_F(SearchTest, IsOverSoonWhereThereIsNobody) {
     const JumpingClock clock;
-    for (const int nSpeaks : {0, 5}) {
+    for (const auto& [nSpeaks, took] : {std::pair(-1, 2.5), {1, 3.5}}) {
         const time_t nStart = gNClockJumped;
         int nSaid = 0;
-        EXPECT_FALSE(Search(30000, [&] {
-            Hear();
-            if (gNClockJumped - nStart == nSpeaks && nSpeaks != 0 && nSaid++ < 2) {
+        EXPECT_FALSE(Search(30000, [&, nSpeaks = nSpeaks] {
+            if (Hear()) {
+                return;
+            }
+            if (gNClockJumped - nStart == nSpeaks && nSaid++ < 2) {
                 Say("HTTP/1.1 404 no\r\n\r\n");
                 return;
             }
             ++gNClockJumped;
         }));
-        EXPECT_NEAR(static_cast<double>(gNClockJumped - nStart), nSpeaks + (nSpeaks == 0 ? 6.5 : 3.5), 0.6) << nSpeaks;
+        EXPECT_NEAR(static_cast<double>(gNClockJumped - nStart), took, 0.6) << nSpeaks;  // and what really went by
     }
+}
+
+// Some answer to the protocol's own port only, and some when nobody waits any more.
+TEST_F(SearchTest, WhatComesFromOddPlacesAndLateIsHeard) {
+    EXPECT_TRUE(Search(5000, [this] {
+        if (Hear() && ntohs(mFrom.sin_port) == 1900) {
+            Say(Answer("/a"));
+        }
+    }, 0, true));
+    EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), 9U);
+    tavo::Descriptor fdLate;
+    const auto fnNever = [](const tavo::HttpUrl&) { return false; };
+    EXPECT_FALSE(tavo::SearchGateway(kGateway, kBox, 100, 0, fnNever, {}, &fdLate));
+    EXPECT_FALSE(tavo::TakeLate(fdLate, kGateway));
+    Hear();
+    for (int i = 0; i < 70; ++i) {
+        Say("HTTP/1.1 404 no\r\n\r\n");
+    }
+    Say(Answer("/late"));
+    EXPECT_FALSE(tavo::TakeLate(fdLate, kGateway)) << "of a flood, so many at once";
+    EXPECT_EQ(tavo::TakeLate(fdLate, kGateway)->szPath, "/late");
 }
 
 TEST_F(SearchTest, TheGatewaysOwnAnnouncementsAreNews) {

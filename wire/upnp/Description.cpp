@@ -75,12 +75,16 @@ IgdModel ReadModel(const XmlElement& root) {
     return model;
 }
 
-// An address of the service, whole or relative to the description; never on another host.
+// An address of the service, whole or relative to the description. Of another host's it is the place on the gateway: a
+// router may call itself by a name, or by another address of its own.
 std::optional<HttpUrl> ResolveAddress(const std::string& szAddress, const std::string& szBase,
                                       const HttpUrl& location) {
     if (szAddress.starts_with("http://")) {
-        const auto url = ParseHttpUrl(szAddress);
-        return url && url->szHost == location.szHost ? url : std::nullopt;
+        auto url = ParseHttpUrl(szAddress);
+        if (url) {
+            url->szHost = location.szHost;
+        }
+        return url;
     }
     HttpUrl url = location;
     if (const auto base = ParseHttpUrl(szBase); base && base->szHost == location.szHost) {
@@ -118,7 +122,7 @@ std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl
     szWhy = !rgServices.empty()   ? ""
             : !root               ? "it cannot be read"
             : rgElements.empty() ? "it has no service that maps ports"
-                                  : "its service is not on the gateway";
+                                  : "its service has no address";
     return rgServices;
 }
 

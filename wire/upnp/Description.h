@@ -27,7 +27,7 @@ struct IgdService {
     IgdModel model;
 };
 // Those of a description, in its order, each place once, and the first few: a router has a service for each line, of
-// which one may be dead. None when it is unreadable, has none, or sends us to another host; szWhy says which.
+// which one may be dead. None when it is unreadable or has none; szWhy says which.
 std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl& location, std::string& szWhy);
 
 }  // namespace tavo

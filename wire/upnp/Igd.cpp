@@ -105,7 +105,8 @@ std::unique_ptr<Igd> Igd::Beside(const std::string& szControl) const {
 }
 
 std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                               IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop) {
+                               IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop,
+                               Descriptor* pFdLate) {
     std::unique_ptr<Igd> pFound;
     const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(nLimitMilliseconds);
     const auto fnLeft = [&] {
@@ -134,7 +135,7 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
     }
     SearchGateway(
         szGateway, szLocal, fnLeft(), nLocalPort,
-        [&](const HttpUrl& location) { return fnTry(location, fnLeft() / 2); }, fnStop);
+        [&](const HttpUrl& location) { return fnTry(location, fnLeft() / 2); }, fnStop, pFdLate);
     return pFound;
 }
 

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "ground/Descriptor.h"
 #include "wire/Answer.h"
 #include "wire/http/Http.h"
 #include "wire/upnp/Description.h"
@@ -54,9 +55,10 @@ public:
     // The IGD at the gateway, found within the limit or not at all. A description is waited for as long as
     // half of what is left of the limit, so that one that never comes does not keep the others from being
     // tried. pPlace (may be null) is tried first, and set to what worked. A search lasts as SearchGateway says.
-    // fnStop is kept for the calls that follow.
+    // fnStop is kept for the calls that follow; pFdLate is as SearchGateway has it.
     static std::unique_ptr<Igd> Find(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds,
-                                     IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop = {});
+                                     IgdPlace* pPlace, int nLocalPort, const std::function<bool()>& fnStop = {},
+                                     Descriptor* pFdLate = nullptr);
     // The IGD whose description is at a location; null when there is none, and szWhy says what there is. Of several
     // services the one that is connected, with a public address before any other and with one before none; szKnown,
     // the control address of one of them, is that one for as long as it is connected.

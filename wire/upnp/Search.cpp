@@ -11,6 +11,8 @@
 #include <chrono>
 #include <iterator>
 #include <set>
+#include <span>
+#include <utility>
 
 #include "ground/Descriptor.h"
 #include "ground/SysLog.h"
@@ -29,12 +31,27 @@ constexpr size_t kMaxReason = 200;
 constexpr size_t kMaxLocations = 16;  // a gateway that names more is playing games
 constexpr int kMaxRefusalsLogged = 8;
 constexpr int kStopPollMilliseconds = 250;
-// UDP gets lost: each question is asked again at these times after the first.
-constexpr int kAskAtMilliseconds[] = {0, 150, 600, 1500, 3000};
+constexpr int kLateAtOnce = 64;
 constexpr auto kSilence = std::chrono::milliseconds(3000);
-constexpr const char* kTargets[] = {
+constexpr auto kNoWord = std::chrono::milliseconds(2500);
+
+using Targets = std::span<const char* const>;
+constexpr const char* kLikely[] = {
     "urn:schemas-upnp-org:device:InternetGatewayDevice:1", "urn:schemas-upnp-org:device:InternetGatewayDevice:2",
     "urn:schemas-upnp-org:service:WANIPConnection:1", "urn:schemas-upnp-org:service:WANPPPConnection:1"};
+// Some answer to nothing else.
+constexpr const char* kRest[] = {"upnp:rootdevice", "ssdp:all", "urn:schemas-upnp-org:service:WANIPConnection:2",
+                                 "urn:dslforum-org:device:InternetGatewayDevice:1",
+                                 "urn:dslforum-org:service:WANPPPConnection:1"};
+
+// UDP gets lost: each question is asked again. The later ones are for a gateway that has said nothing yet.
+struct Asking {
+    int nMilliseconds;
+    Targets rgTargets;
+    bool blKnownPort = false;  // from the port of the protocol: some answer to that one only
+};
+constexpr Asking kAskings[] = {{0, kLikely},    {150, kLikely},  {300, kRest}, {600, kLikely},
+                               {1000, kRest}, {1300, kLikely, true}, {1500, kLikely}};
 
 sockaddr_in Address(const char* szHost, uint16_t nPort) {
     sockaddr_in address = {};
@@ -48,8 +65,8 @@ void Send(int fd, const std::string& szText, const sockaddr_in& to) {
     sendto(fd, szText.data(), szText.size(), 0, reinterpret_cast<const sockaddr*>(&to), sizeof(to));
 }
 
-void Ask(int fd, const std::string& szGateway) {
-    for (const char* szTarget : kTargets) {
+void Ask(int fd, const std::string& szGateway, Targets rgTargets) {
+    for (const char* szTarget : rgTargets) {
         for (const std::string& szHost : {szGateway, std::string(kGroup)}) {
             Send(fd,
                  "M-SEARCH * HTTP/1.1\r\nHOST: " + szHost +
@@ -66,6 +83,8 @@ bool Bind(int fd, const sockaddr_in& local) {
 Descriptor OpenSocket(const std::string& szLocal, int nLocalPort) {
     Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     const sockaddr_in local = Address(szLocal.c_str(), static_cast<uint16_t>(nLocalPort));
+    const int nShared = nLocalPort == kSsdpPort ? 1 : 0;  // with whoever listens to announcements
+    setsockopt(fd.Get(), SOL_SOCKET, SO_REUSEADDR, &nShared, sizeof(nShared));
     if (fd.Get() < 0 || (!Bind(fd.Get(), local) && !Bind(fd.Get(), Address(szLocal.c_str(), 0)))) {
         return Descriptor();
     }
@@ -84,22 +103,28 @@ bool IsAddressForDevices(const std::string& szHost) {
     return !blLoopback && !blLinkLocal && nHost != 0;
 }
 
-// Where one answer from the gateway points; the first refusals are logged. blHeard: it said something at all.
-std::optional<HttpUrl> Receive(int fd, const std::string& szGateway, bool& blHeard, int& nRefused) {
+struct Heard {
+    bool blAnything = false;  // from anybody
+    bool blGateway = false;   // from the gateway itself, though it may lead nowhere
+    std::optional<HttpUrl> location = {};
+};
+
+// Takes in one answer. nRefused: how many of the gateway's led nowhere; the first of them are logged.
+Heard Receive(int fd, const std::string& szGateway, int& nRefused) {
     char szAnswer[kMaxAnswer];
     sockaddr_in from = {};
     socklen_t nLength = sizeof(from);
     const ssize_t nRead = recvfrom(fd, szAnswer, sizeof(szAnswer), 0, reinterpret_cast<sockaddr*>(&from), &nLength);
-    if (nRead <= 0 || from.sin_addr.s_addr != Address(szGateway.c_str(), 0).sin_addr.s_addr) {
-        return std::nullopt;  // another device on the network: not our router
+    if (nRead < 0) {
+        return {};
     }
-    blHeard = true;
+    Heard heard{true, from.sin_addr.s_addr == Address(szGateway.c_str(), 0).sin_addr.s_addr};
     std::string szReason;
-    auto location = LocationOf({szAnswer, static_cast<size_t>(nRead)}, szGateway, szReason);
-    if (!location && ++nRefused <= kMaxRefusalsLogged) {
+    heard.location = LocationOf({szAnswer, static_cast<size_t>(nRead)}, szGateway, heard.blGateway, szReason);
+    if (heard.blGateway && !heard.location && ++nRefused <= kMaxRefusalsLogged) {
         SysLog(LOG_WARNING, "router's discovery answer refused: %s", szReason.c_str());
     }
-    return location;
+    return heard;
 }
 
 int MillisecondsUntil(Clock::time_point when) {
@@ -109,7 +134,8 @@ int MillisecondsUntil(Clock::time_point when) {
 
 }  // namespace
 
-std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& szGateway, std::string& szReason) {
+std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& szGateway, bool blGateway,
+                                  std::string& szReason) {
     if (!szAnswer.starts_with("HTTP/1.") || szAnswer.substr(0, 16).find(" 200") == std::string_view::npos) {
         szReason = "no positive answer";
         return std::nullopt;
@@ -120,8 +146,9 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
             continue;
         }
         const std::string szUrl(Trim(szLine.substr(kHeader.size())));
-        const std::optional<HttpUrl> url = ParseHttpUrl(szUrl);
-        if (url && url->szHost == szGateway && IsAddressForDevices(url->szHost)) {
+        std::optional<HttpUrl> url = ParseHttpUrl(szUrl);
+        if (url && (blGateway || url->szHost == szGateway) && IsAddressForDevices(szGateway)) {
+            url->szHost = szGateway;
             return url;
         }
         szReason = "LOCATION is not on the gateway: " + PrintableText(szUrl, kMaxReason);
@@ -132,42 +159,63 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
 }
 
 bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
-                   const std::function<bool(const HttpUrl&)>& fnTry, const std::function<bool()>& fnStop) {
-    const Descriptor fd = OpenSocket(szLocal, nLocalPort);
+                   const std::function<bool(const HttpUrl&)>& fnTry, const std::function<bool()>& fnStop,
+                   Descriptor* pFdLate) {
+    Descriptor fd = OpenSocket(szLocal, nLocalPort);
+    Descriptor fdKnown;
     if (fd.Get() < 0) {
         return false;
     }
     const Clock::time_point start = Clock::now();
     const Clock::time_point limit = start + std::chrono::milliseconds(nLimitMilliseconds);
-    Clock::time_point end =
-        std::min(limit, start + std::chrono::milliseconds(*std::rbegin(kAskAtMilliseconds)) + kSilence);
+    Clock::time_point end = std::min<Clock::time_point>(limit, start + kNoWord);
     std::set<std::string> setSeen;
     size_t nAsked = 0;
     int nRefused = 0;
-    while (Clock::now() < end && setSeen.size() < kMaxLocations && !(fnStop && fnStop())) {
+    bool blFound = false;
+    bool blSpoke = false;
+    while (!blFound && Clock::now() < end && setSeen.size() < kMaxLocations && !(fnStop && fnStop())) {
         Clock::time_point wake = end;
-        if (nAsked < std::size(kAskAtMilliseconds)) {
-            wake = std::min(end, start + std::chrono::milliseconds(kAskAtMilliseconds[nAsked]));
+        if (nAsked < std::size(kAskings)) {
+            const Asking& asking = kAskings[nAsked];
+            wake = std::min(end, start + std::chrono::milliseconds(asking.nMilliseconds));
             if (MillisecondsUntil(wake) == 0) {
-                Ask(fd.Get(), szGateway);
+                if (asking.blKnownPort && !blSpoke) {
+                    fdKnown = OpenSocket(szLocal, kSsdpPort);
+                }
+                if (asking.rgTargets.data() == kLikely || !blSpoke) {
+                    Ask(asking.blKnownPort ? fdKnown.Get() : fd.Get(), szGateway, asking.rgTargets);
+                }
                 ++nAsked;
                 continue;
             }
         }
-        pollfd waiting = {fd.Get(), POLLIN, 0};
-        if (poll(&waiting, 1, std::min(MillisecondsUntil(wake) + 1, kStopPollMilliseconds)) <= 0) {
+        pollfd rgWaiting[] = {{fd.Get(), POLLIN, 0}, {fdKnown.Get(), POLLIN, 0}};
+        if (poll(rgWaiting, std::size(rgWaiting), std::min(MillisecondsUntil(wake) + 1, kStopPollMilliseconds)) <= 0) {
             continue;
         }
-        bool blHeard = false;
-        const std::optional<HttpUrl> location = Receive(fd.Get(), szGateway, blHeard, nRefused);
-        if (location && setSeen.insert(location->Text()).second && fnTry(*location)) {
-            return true;
-        }
-        if (blHeard) {
+        const Heard heard = Receive(rgWaiting[0].revents != 0 ? fd.Get() : fdKnown.Get(), szGateway, nRefused);
+        blFound = heard.location && setSeen.insert(heard.location->Text()).second && fnTry(*heard.location);
+        if (heard.blGateway || heard.location) {
+            blSpoke = true;
             end = std::min(limit, std::max(end, Clock::now() + kSilence));
         }
     }
-    return false;
+    if (!blFound && pFdLate != nullptr) {
+        *pFdLate = std::move(fd);
+    }
+    return blFound;
+}
+
+std::optional<HttpUrl> TakeLate(const Descriptor& fdLate, const std::string& szGateway) {
+    int nRefused = kMaxRefusalsLogged;
+    for (int i = 0; i < kLateAtOnce; ++i) {
+        const Heard heard = Receive(fdLate.Get(), szGateway, nRefused);
+        if (heard.location || !heard.blAnything) {
+            return heard.location;
+        }
+    }
+    return std::nullopt;
 }
 
 }  // namespace tavo
