@@ -553,9 +553,10 @@ RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) 
 PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& habit,
                        const Surroundings& around) {
     if (habit.router != record.Router()) {
-        // That it takes no lease is true for as long as nothing says that it is another one.
+        // What it can do is true for as long as nothing says that it is another one.
         const bool blOther = !habit.router.szGateway.empty() && !habit.router.IsSame(record.Router());
         habit.blPermanentOnly = habit.blPermanentOnly && !blOther;
+        habit.blNoRanges = habit.blNoRanges && !blOther;
         habit.mapElsewhere.clear();
         habit.setLost.clear();
         habit.router = record.Router();

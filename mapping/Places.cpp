@@ -175,8 +175,7 @@ void Places::LookAt(PlaceList& rgpPlaces) {
 void Places::LookAtRanges(PlaceList rgpPlaces, const std::function<void(Place&)>& fnCovered) {
     std::sort(rgpPlaces.begin(), rgpPlaces.end(),
               [](const Place* pOne, const Place* pOther) { return pOne->key < pOther->key; });
-    bool blShows = true;
-    for (auto it = rgpPlaces.begin(); it != rgpPlaces.end() && blShows && !guard.IsOver();) {
+    for (auto it = rgpPlaces.begin(); it != rgpPlaces.end() && !habit.blNoRanges && !guard.IsOver();) {
         const MappingKey& first = (*it)->key;
         const auto end = std::find_if(it, rgpPlaces.end(), [&](const Place* pPlace) {
             return pPlace->key.first != first.first || pPlace->key.second - first.second >= kRangePorts;
@@ -184,8 +183,8 @@ void Places::LookAtRanges(PlaceList rgpPlaces, const std::function<void(Place&)>
         if (end - it >= kRangeFrom) {
             const uint16_t nLast = (*std::prev(end))->key.second;
             std::vector<RouterMapping> rgShown;
-            blShows = guard.Note(router.ListRange(first.first, first.second, nLast, rgShown)).IsOk();
-            if (blShows) {
+            habit.blNoRanges = !guard.Note(router.ListRange(first.first, first.second, nLast, rgShown)).IsOk();
+            if (!habit.blNoRanges) {
                 std::for_each(it, end, [&](Place* pPlace) { fnCovered(*pPlace); });
             }
             for (const RouterMapping& entry : rgShown) {

@@ -81,6 +81,8 @@ Verdict StillHeld(Places& places, const Place& place, const RouterReply& reply) 
     if (pMade->End() >= nNow) {  // else the router does not keep to it, and nobody knows for how long
         verdict.nLease = static_cast<uint32_t>(std::max<int64_t>(pMade->End() - nNow, 1));
         places.Wake(pMade->End() + 1);
+    } else if (pMade->nLease != 0 && !pMade->IsSurelyOver(nNow, true)) {  // some end a lease late
+        places.Wake(nNow + kLeastPause);
     }
     return verdict;
 }

@@ -18,6 +18,9 @@ constexpr std::pair<std::string_view, const char*> kCommonWords[] = {
 
 constexpr size_t kMostRouters = 16;  // whose clocks are kept
 constexpr int kYoungAgain = 10;      // seconds until a gateway that has just started is asked once more
+// Anybody on the network can say that the router has begun anew. Its clock is asked each time; that all is asked for
+// again whatever the clock says, and put on record, happens once in this time.
+constexpr auto kDoubtPause = std::chrono::minutes(10);
 constexpr char kMadeFile[] = "/var/lib/tavo/natpmp_made.conf";
 
 RouterState StateOf(Reply enReply) {
@@ -52,7 +55,10 @@ void NatpmpMapper::NewGateway() {
 
 bool NatpmpMapper::OnWake() {
     bool blRestart = RuleMapper::OnWake();
-    mBlDoubtful = mBlDoubtful || blRestart;  // its clock may not show it
+    if (blRestart && BootClock::now() >= mNextDoubt) {  // its clock may not show it
+        mBlDoubtful = true;
+        mNextDoubt = BootClock::now() + kDoubtPause;
+    }
     for (const GatewayAnnouncement& said : mAnnounced.Take(Gateway())) {
         blRestart = blRestart || (mPEpoch != nullptr && mPEpoch->IsRestart(said.nEpoch, BootClock::now()));
     }

@@ -34,6 +34,8 @@ void UpnpMapper::NewGateway() {
     KnownRouter known = RecallRouter(Gateway());
     mPlace = std::move(known.place);
     mHabit.blPermanentOnly = known.blPermanentOnly;
+    mHabit.blNoRanges = known.blNoRanges;
+    mSzKnownHardware = std::move(known.szHardware);
 }
 
 void UpnpMapper::LostRouter() {
@@ -44,14 +46,12 @@ void UpnpMapper::LostRouter() {
 // Where does the router's service live. False: there is none that we can use.
 bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
-        const IgdPlace known = mPlace;
+        const std::string szBefore = mPlace.szControl;
         mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mPlace, 0, fnStop, &mFdLate);
         if (mPIgd != nullptr) {
             mFdLate.Reset();
-            mHabit.blPermanentOnly = mHabit.blPermanentOnly && mPlace == known;  // it may be another one
-            mPBefore = mPIgd->Beside(known.szControl);
+            mPBefore = mPIgd->Beside(szBefore);
             mEvents.TurnTo(mPIgd->Service().events, Box());
-            Remember();
         }
     }
     return mPIgd != nullptr;
@@ -68,8 +68,19 @@ void UpnpMapper::ChooseLine(const std::function<bool()>& fnStop) {
 }
 
 // What worked is tried first the next time, also after a restart.
-void UpnpMapper::Remember() const {
-    KeepRouter(Gateway(), {mPlace, mHabit.blPermanentOnly});
+void UpnpMapper::Remember() {
+    if (const std::string& szHardware = mMade.Get().Router().szHardware; !szHardware.empty()) {
+        mSzKnownHardware = szHardware;
+    }
+    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mHabit.blNoRanges});
+}
+
+// Another device at the address of the one before has habits of its own.
+void UpnpMapper::TurnTo(const RouterName& router) {
+    mMade.Get().TurnTo(router);
+    if (!router.IsSame({Gateway(), mSzKnownHardware})) {
+        mHabit = {};
+    }
 }
 
 // Before the table is read: what changes after that is told.
@@ -121,11 +132,10 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         }
         return result;
     }
-    mMade.Get().TurnTo(Front(fnStop));
+    TurnTo(Front(fnStop));
     mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
-    const bool blPermanentOnly = mHabit.blPermanentOnly;
     KeepEvents(rgWanted, fnStop);
     IgdRouter router(*mPIgd);
     bool blChanged = false;
@@ -143,9 +153,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);
     mQuietUntil = blChanged ? BootClock::now() + kEcho : mQuietUntil;
     result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;
-    if (blPermanentOnly != mHabit.blPermanentOnly) {
-        Remember();
-    }
+    Remember();
     return result;
 }
 

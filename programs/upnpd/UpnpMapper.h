@@ -33,12 +33,14 @@ private:
     void LostRouter() override;
 
     bool FindRouter(const std::function<bool()>& fnStop);
-    void Remember() const;
+    void Remember();
+    void TurnTo(const RouterName& router);
     void ChooseLine(const std::function<bool()>& fnStop);
     void KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     IgdPlace mPlace;
+    std::string mSzKnownHardware;  // of the router whose habits are known
     std::unique_ptr<Igd> mPIgd;
     std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
     Descriptor mFdLate;  // where nothing was found, what comes later is heard

@@ -82,12 +82,6 @@ class Detection(unittest.TestCase):
     def test_router_that_is_not_the_gateway(self):
         self.find_no_upnp("none", 5000, "lan2", LAN2)
 
-    def test_location_on_another_host(self):
-        self.find_no_upnp("location_other_host")
-
-    def test_location_on_this_box(self):
-        self.find_no_upnp("location_loopback")
-
     def test_broken_networks(self):
         LAB.start_router()
         sh("ip -n box route del default")

@@ -498,7 +498,6 @@ TEST(Igd, WhatAnEntryAndAnAddressSay) {
     EXPECT_EQ(pIgd->Get("TCP", 1, rgMappings.emplace_back()), 606);
     EXPECT_EQ(pIgd->GetAt(0, rgMappings.back()), 606);
     EXPECT_EQ(pIgd->ListRange("TCP", 1, 2, rgMappings), 606);
-    EXPECT_EQ(pIgd->ListRange("TCP", 1, 2, rgMappings), 401) << "one that could not once is not asked again";
     EXPECT_EQ(pHttp->mNPosts, 5);
 }
 
@@ -715,7 +714,7 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         gSzGateway = kGateway;
         WebServer server(szPage, kGateway);
         const std::string szKnown = "http://192.168.77.1:" + std::to_string(server.Port()) + "/x";
-        tavo::KeepRouter(kGateway, {{szKnown, ""}, true});
+        tavo::KeepRouter(kGateway, {{szKnown, ""}, "aa", true});
         std::string szLocal;
         EXPECT_NE(tavo::FindGatewayIgd(300, 0, &szLocal, {}), nullptr);
         EXPECT_TRUE(szLocal.starts_with("192.168.77.")) << szLocal;
@@ -738,7 +737,7 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         }
     });
     gSzGateway = kGateway;
-    tavo::KeepRouter(kGateway, {{"http://192.168.77.1:1/gone", ""}, true});
+    tavo::KeepRouter(kGateway, {{"http://192.168.77.1:1/gone", ""}, "aa", true});
     EXPECT_NE(tavo::FindGatewayIgd(5000, 0, nullptr, {}), nullptr);
     blEnd = true;
     gateway.join();
@@ -792,7 +791,9 @@ TEST(Notify, EachDeviceOfARouterHasALifeOfItsOwn) {
     // One that takes its leave is forgotten, and it alone.
     tavo::Lives some;
     EXPECT_TRUE(some.IsNews(fnMessage("igd", "x")) && some.IsNews(fnMessage("media", "y")));
-    EXPECT_FALSE(some.IsNews("NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nUSN: uuid:igd::upnp:rootdevice\r\n\r\n"));
+    const char* szGoodbye = "NOTIFY * HTTP/1.1\r\nNTS: ssdp:byebye\r\nUSN: uuid:igd::upnp:rootdevice\r\n\r\n";
+    EXPECT_TRUE(some.IsNews(szGoodbye));
+    EXPECT_FALSE(some.IsNews(szGoodbye)) << "it had gone";
     EXPECT_FALSE(some.IsNews(fnMessage("media", "y")));
     EXPECT_TRUE(some.IsNews(fnMessage("igd", "x")));
 }

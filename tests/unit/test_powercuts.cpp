@@ -310,10 +310,10 @@ const std::vector<Store>& Stores() {
          KeptTest, "old", "new"},
         {"a known router",
          [] {
-             tavo::KeepRouter("192.168.1.1", {{"old", ""}, false});
+             tavo::KeepRouter("192.168.1.1", {{"old", ""}});
          },
          [] {
-             tavo::KeepRouter("192.168.1.1", {{"new", ""}, false});
+             tavo::KeepRouter("192.168.1.1", {{"new", ""}});
              return true;
          },
          [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old", "new", "", true},

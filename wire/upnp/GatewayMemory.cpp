@@ -27,19 +27,22 @@ std::string StateOf(const std::string& szGateway, const char* szKey) {
 }  // namespace
 
 KnownRouter RecallRouter(const std::string& szGateway) {
-    return {{StateOf(szGateway, "location"), StateOf(szGateway, "service")}, StateOf(szGateway, "permanent") == "yes"};
+    const auto fnValue = [&](const char* szKey) { return StateOf(szGateway, szKey); };
+    return {{fnValue("location"), fnValue("service")}, fnValue("hardware"), fnValue("permanent") == "yes",
+            fnValue("ranges") == "no"};
 }
 
 void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
-    const KnownRouter before = RecallRouter(szGateway);
-    if (before.place == router.place && before.blPermanentOnly == router.blPermanentOnly) {
+    if (RecallRouter(szGateway) == router) {
         return;
     }
     MakeDirectory(kStateDir);
-    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(3), &TLIBCSzHashFree);
+    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(5), &TLIBCSzHashFree);
     TLIBCSzHashSetValue(pHash.get(), "location", router.place.szLocation.c_str());
     TLIBCSzHashSetValue(pHash.get(), "service", router.place.szControl.c_str());
+    TLIBCSzHashSetValue(pHash.get(), "hardware", router.szHardware.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
+    TLIBCSzHashSetValue(pHash.get(), "ranges", router.blNoRanges ? "no" : "yes");
     if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
         SysLog(LOG_WARNING, "cannot write %s", kStateFile);
     }

@@ -12,7 +12,11 @@ namespace tavo {
 
 struct KnownRouter {
     IgdPlace place;  // where its service was last found
+    std::string szHardware = {};  // of the router that this is true of; empty: not known
     bool blPermanentOnly = false;
+    bool blNoRanges = false;
+
+    bool operator==(const KnownRouter& other) const = default;
 };
 
 KnownRouter RecallRouter(const std::string& szGateway);

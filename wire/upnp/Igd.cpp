@@ -231,7 +231,7 @@ int Igd::List(std::vector<IgdEntry>& rgMappings) {
 }
 
 int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast, std::vector<IgdEntry>& rgMappings) {
-    if (!mBlRanges) {
+    if (mService.szType.ends_with(":1")) {
         return kIgdInvalidAction;
     }
     const SoapAnswer answer = Call("GetListOfPortMappings", {{"NewStartPort", std::to_string(nFirst)},
@@ -239,11 +239,10 @@ int Igd::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLas
                                                              {"NewProtocol", szProtocol},
                                                              {"NewManage", "0"},
                                                              {"NewNumberOfPorts", "0"}});
-    mBlRanges = answer.IsOk() || answer.Code() == kIgdNoneInRange;
     if (answer.IsOk()) {
         rgMappings = ReadListing(answer);
     }
-    return mBlRanges ? int{kWireOk} : answer.Code();
+    return answer.Code() == kIgdNoneInRange ? int{kWireOk} : answer.Code();
 }
 
 int Igd::Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping) {

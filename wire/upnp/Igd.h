@@ -76,8 +76,8 @@ public:
     // The router's address on its other side, as it says itself.
     int ExternalAddress(std::string& szAddress);
     int List(std::vector<IgdEntry>& rgMappings);
-    // The box's own entries between two ports, where the router can show them at once. May leave some out: what it
-    // shows is there, what it does not show may be there too.
+    // The box's own entries between two ports, where the router can show them at once: of the second generation only.
+    // May leave some out: what it shows is there, what it does not show may be there too.
     int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast, std::vector<IgdEntry>& rgMappings);
     int Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping);
     int Add(const IgdEntry& mapping);
@@ -91,13 +91,12 @@ public:
 
 private:
     Igd(IgdService service, std::shared_ptr<HttpTransport> pHttp)
-        : mService(std::move(service)), mBlRanges(!mService.szType.ends_with(":1")), mPHttp(std::move(pHttp)) {}
+        : mService(std::move(service)), mPHttp(std::move(pHttp)) {}
     int Rank(const std::string& szKnown);
     SoapAnswer Call(const char* szAction, const std::vector<SoapArgument>& rgArguments);
 
     IgdService mService;
     std::vector<IgdService> mRgBeside;
-    bool mBlRanges;  // services of the second generation show ranges, unless they once could not
     std::shared_ptr<HttpTransport> mPHttp;
 };
 

@@ -42,7 +42,8 @@ std::optional<std::string> LifeOf(std::string_view szMessage) {
         return szKind == "ssdp:byebye" ? std::optional<std::string>("") : std::nullopt;
     }
     const std::string_view szBoot = Header(szMessage, "BOOTID.UPNP.ORG:");
-    return PrintableText(szBoot.empty() ? Header(szMessage, "LOCATION:") : szBoot, kMaxLife);
+    std::string szLife = PrintableText(szBoot.empty() ? Header(szMessage, "LOCATION:") : szBoot, kMaxLife);
+    return szLife.empty() ? std::nullopt : std::optional(std::move(szLife));
 }
 
 bool Lives::IsNews(std::string_view szMessage) {
@@ -52,8 +53,7 @@ bool Lives::IsNews(std::string_view szMessage) {
     }
     const std::string szDevice = PrintableText(Header(szMessage, "USN:"), kMaxLife);
     if (szLife->empty()) {
-        mMapLives.erase(szDevice);
-        return false;
+        return mMapLives.erase(szDevice) != 0;
     }
     if (mMapLives.size() >= kMostDevices && !mMapLives.contains(szDevice)) {
         mMapLives.clear();

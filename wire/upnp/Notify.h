@@ -1,4 +1,4 @@
-// What a router says of its own accord by SSDP: that it has begun anew. Relies on one multicast UDP socket.
+// What a router says of its own accord by SSDP: that it has begun anew, or goes. Relies on one multicast UDP socket.
 // Promises: never waits; only what comes from the gateway's address counts, and it is a hint, no more.
 #pragma once
 
@@ -19,7 +19,7 @@ std::optional<std::string> LifeOf(std::string_view szMessage);
 // The last life of each device of a router: most routers are several. Bounded, whatever is said.
 class Lives {
 public:
-    // Whether a device is heard for the first time, after its goodbye too, or has another life.
+    // Whether a device is heard for the first time, has another life, or says goodbye.
     bool IsNews(std::string_view szMessage);
     void Forget() { mMapLives.clear(); }
 
