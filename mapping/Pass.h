@@ -42,6 +42,7 @@ struct Surroundings {
     std::function<void(const RouterMapping&, const Step&)> fnTell = [](const RouterMapping&, const Step&) {};
     // What another daemon of this box sees to, by place the port of the box: what leads there is not taken away.
     std::map<MappingKey, uint16_t> mapOthers = {};
+    std::function<void()> fnHeard = {};  // may be empty; is told of each answer of the router
 };
 
 struct PassResult {
@@ -55,8 +56,13 @@ struct PassResult {
 
 class PassGuard {
 public:
-    PassGuard(PassResult& result, const std::function<bool()>& fnStop, std::function<int64_t()> fnNow = BootSeconds)
-        : mResult(result), mFnStop(fnStop), mFnNow(std::move(fnNow)), mNEnd(mFnNow() + kPassLimit) {}
+    PassGuard(PassResult& result, const std::function<bool()>& fnStop, std::function<int64_t()> fnNow = BootSeconds,
+              std::function<void()> fnHeard = {})
+        : mResult(result),
+          mFnStop(fnStop),
+          mFnNow(std::move(fnNow)),
+          mFnHeard(std::move(fnHeard)),
+          mNEnd(mFnNow() + kPassLimit) {}
 
     bool IsOver() {
         mResult.blStopped = mResult.blStopped || mFnStop();
@@ -68,6 +74,9 @@ public:
         mNSilent = reply.IsSilence() ? mNSilent + 1 : 0;
         mBlSense =
             mBlSense || reply.IsOk() || reply.enReply == Reply::kNoSuchEntry || reply.enReply == Reply::kConflict;
+        if (mFnHeard && !reply.IsSilence()) {
+            mFnHeard();
+        }
         if (mNSilent >= kTransportTries || reply.enReply == Reply::kUnreachable) {
             mResult.transport = reply;
         }
@@ -88,6 +97,7 @@ private:
     PassResult& mResult;
     const std::function<bool()>& mFnStop;
     std::function<int64_t()> mFnNow;
+    std::function<void()> mFnHeard;
     int64_t mNEnd;
     int mNSilent = 0;
     bool mBlSense = false;

@@ -28,7 +28,7 @@ Places::Places(Router& aRouter, const std::vector<RouterMapping>& rgWanted, Reco
       rows(record.Here()),
       habit(aHabit),
       around(surroundings),
-      guard(result, around.fnStop, around.fnNow) {
+      guard(result, around.fnStop, around.fnNow, around.fnHeard) {
     std::set<std::pair<std::string, uint16_t>> setBoxPorts;  // the first rule that asks for one has it
     for (const RouterMapping& wanted : rgWanted) {
         Place& place = At(KeyOf(wanted));

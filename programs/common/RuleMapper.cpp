@@ -25,6 +25,7 @@ constexpr int kRetrySeconds = 10;  // until a run key that could not be mended i
 constexpr int kWithdrawTries = 3;
 constexpr auto kTurnLimit = std::chrono::seconds(60);     // the other daemon takes its mappings away meanwhile
 constexpr auto kLastTurnLimit = std::chrono::seconds(5);  // at the end: the other daemon may be ending, too
+constexpr auto kSilentLimit = std::chrono::seconds(10);   // at the end: the router has not answered for so long
 constexpr size_t kAddressSize = 16;
 constexpr int kPassesToOutside = 5;
 constexpr char kNoAddress[] = "0.0.0.0";  // how a router says that it has none
@@ -285,7 +286,10 @@ void RuleMapper::TellNews(const Published& state, bool blRequested) {
     mTold.Save();
 }
 
-bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
+// Goes on for as long as the router answers, within the bound that fnEnd has.
+bool RuleMapper::Withdraw(const std::function<bool()>& fnEnd) {
+    Heard();
+    const std::function<bool()> fnStop = [&] { return fnEnd() || BootClock::now() > mHeard + kSilentLimit; };
     Unpublish(mNames.szName);
     bool blTurn = mTurn.Take([] { return false; });
     if (!blTurn) {
@@ -299,6 +303,7 @@ bool RuleMapper::Withdraw(const std::function<bool()>& fnStop) {
         return false;  // nobody knows what is the other's
     }
     const std::vector<RouterMapping> rgOthers = mWanted.rgOthers.value_or(mWanted.rgMappings);
+    Heard();  // what was waited for was not the router
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
         const PassResult result = blTurn ? Map({}, false, fnStop) : TakeAwayBesides(rgOthers, fnStop);
         if (result.transport.IsOk() && result.rgOutcomes.empty()) {

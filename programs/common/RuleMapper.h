@@ -31,7 +31,7 @@ class RuleMapper : public Mapper {
 public:
     int Run(bool blRequested, const std::function<bool()>& fnStop) final;
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
-    bool Withdraw(const std::function<bool()>& fnStop) final;
+    bool Withdraw(const std::function<bool()>& fnEnd) final;
     bool OnNetworkChange() final;
     std::vector<int> WakeFds() const override { return {mAnnouncements.Fd()}; }
     // The gateway has begun anew, by what it announces as a UPnP device, which most are whatever maps ports there.
@@ -62,6 +62,8 @@ protected:
     // The router in front. The kernel forgets hardware, as when the cable was out; at one address it is asked for it,
     // or else the same as before.
     RouterName Front(const std::function<bool()>& fnStop);
+    // The router has answered: a stop goes on.
+    void Heard() { mHeard = BootClock::now(); }
     uint32_t WishedLease() const { return mNWishedLease; }
     // What a pass leaves alone, as the other daemon has the turn: by place, the port of the box.
     const std::map<MappingKey, uint16_t>& Others() const { return mMapOthers; }
@@ -97,6 +99,7 @@ private:
     std::string mSzHardware;  // of the gateway, as it was last seen
     Keeper mKeeper;
     std::string mSzLast;  // what the last pass had to say
+    BootClock::time_point mHeard;  // when the router last answered
     std::string mSzOutside;
     int mNUntilOutside = 0;  // passes until the router is asked for it again
     ToldFile mTold;

@@ -95,6 +95,7 @@ PassResult NatpmpMapper::Map(const std::vector<RouterMapping>& rgWanted, bool bl
     Forget(record, mHabit, Box(), blRestarted, blRequested || mBlDoubtful, BootSeconds());
     Surroundings around = Around(Box(), fnStop, mMade);
     around.mapOthers = Others();
+    around.fnHeard = [this] { Heard(); };
     const auto fnPass = [&] { return BringInLine(router, rgWanted, record, mHabit, around); };
     PassResult result = fnPass();
     if (mPEpoch->TakeRestart()) {  // it restarted while we spoke

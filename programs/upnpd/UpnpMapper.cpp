@@ -141,6 +141,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     bool blChanged = false;
     Surroundings around = Around(Box(), fnStop, mMade);
     around.mapOthers = Others();
+    around.fnHeard = [this] { Heard(); };
     around.fnTell = [&blChanged, fnLog = around.fnTell](const RouterMapping& mapping, const Step& step) {
         blChanged = true;
         fnLog(mapping, step);

@@ -239,7 +239,7 @@ class Lab:
             pid = self.daemon_pid(daemon)
             if pid:
                 os.kill(pid, how)
-                wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 15, "the daemon has ended")
+                wait_for(lambda: not os.path.exists(f"/proc/{pid}"), 70, "the daemon has ended")
 
     def close(self):
         self.stop_daemon(signal.SIGKILL)

@@ -18,7 +18,7 @@ FOREIGN = "192.168.77.3"
 FAULT = sys.argv[1]
 PORT = int(sys.argv[2]) if len(sys.argv) > 2 else 5000
 ADDRESS = sys.argv[3] if len(sys.argv) > 3 else "192.168.77.1"
-SERVICE = "urn:schemas-upnp-org:service:WANIPConnection:1"
+SERVICE = f"urn:schemas-upnp-org:service:WANIPConnection:{2 if FAULT == 'dies_of_ranges' else 1}"
 TABLE, COUNT, ASKED_402 = {}, {}, set()
 if FAULT == "slow_table":
     TABLE.update({("UDP", port): (FOREIGN, port, 0, "theirs") for port in range(1, 25)})
@@ -174,8 +174,13 @@ class Handler(BaseHTTPRequestHandler):
         if FAULT == "late_reply" and action == "AddPortMapping":
             time.sleep(8)
         time.sleep(max(0, HANG_UNTIL - time.monotonic()))
+        time.sleep(1 if FAULT == "slow" else 0)
         if FAULT == "drips_actions" and action == "AddPortMapping":
             self.stream(b"HTTP/1.1 200 OK\r\n\r\n", b"<", 1)
+            return
+        if FAULT == "dies_of_ranges" and action == "GetListOfPortMappings":
+            self.wfile.write(b"HTTP/1.1 200 OK\r\nContent-Length: 99\r\n\r\n<")
+            self.close_connection = True
             return
         if FAULT == "dies_listing" and action == "GetGenericPortMappingEntry" and "Index>1<" in body:
             self.close_connection = True

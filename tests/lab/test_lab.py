@@ -171,6 +171,7 @@ class FaultyRouter(unittest.TestCase):
         ("silent", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
         ("drip", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
         ("half_reply", one, 9, "5001/tcp", {"5001/tcp": "noigd"}, 0, 25),
+        ("dies_of_ranges", many, 0, "", {}, 40, 10),
         ("location_other_host", one, 0, "", {"5001/tcp": "1"}, 1, 25),
         ("location_loopback", one, 0, "", {"5001/tcp": "1"}, 1, 25),
     )
@@ -200,12 +201,23 @@ class FaultyRouter(unittest.TestCase):
                         self.assertEqual(len(ours), entries)
                     if fault.startswith("location"):  # wherever it leads, it is read at the gateway
                         self.assertIn("/d.xml", state["count"])
+                    if fault == "dies_of_ranges":  # it is asked once, also by the next process
+                        LAB.stop_daemon(signal.SIGKILL)
+                        LAB.save(*(f"{port},1,tcp,{port},{port}" for port in ports[:20]), seconds=bound)
+                        self.assertEqual(LAB.scripted()["count"]["GetListOfPortMappings"], 1)
                     if fault == "only_permanent":  # learnt once, not once a rule
                         self.assertEqual(state["count"]["AddPortMapping"], 41)
                     if fault == "bad_descriptions":  # each was tried, and none kept the good one from being found
                         self.assertGreaterEqual(sum(path.startswith("/") for path in state["count"]), 12)
                 finally:
                     self.clean()
+
+    def test_a_stop_goes_on_while_the_router_answers(self):
+        LAB.install()
+        LAB.start_scripted("slow")
+        self.assertEqual(LAB.save(*(f"{port},1,tcp,{port},{port}" for port in range(5001, 5008)), seconds=40)["status"], 0)
+        LAB.stop_daemon(signal.SIGTERM)
+        self.assertEqual(LAB.scripted()["table"], [])
 
     def test_a_stop_keeps_its_bound_whatever_the_router_does(self):
         """For so many seconds the router answers nothing; what is left of the mapping, if it is known."""

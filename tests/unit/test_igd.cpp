@@ -714,12 +714,12 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         gSzGateway = kGateway;
         WebServer server(szPage, kGateway);
         const std::string szKnown = "http://192.168.77.1:" + std::to_string(server.Port()) + "/x";
-        tavo::KeepRouter(kGateway, {{szKnown, ""}, "aa", true});
+        const tavo::KnownRouter known{{szKnown, ""}, "aa", true, true};
+        tavo::KeepRouter(kGateway, known);
         std::string szLocal;
         EXPECT_NE(tavo::FindGatewayIgd(300, 0, &szLocal, {}), nullptr);
         EXPECT_TRUE(szLocal.starts_with("192.168.77.")) << szLocal;
-        EXPECT_EQ(tavo::RecallRouter(kGateway).place.szLocation, szKnown);
-        EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
+        EXPECT_EQ(tavo::RecallRouter(kGateway), known);
         tavo::KeepRouter(kGateway, {});
         EXPECT_EQ(tavo::FindGatewayIgd(100, 0, nullptr, {}), nullptr);
         gSzGateway = "";

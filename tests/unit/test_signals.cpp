@@ -192,7 +192,7 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         bool blSlow = false;
         const char* szSecond = "";
     };
-    const char* szStays = "21 s played that runs does not end (lock /run/played.lock)\n";  // with the first look
+    const char* szStays = "71 s played that runs does not end (lock /run/played.lock)\n";  // with the first look
     const char* szTaken = "0 s played is running (lock /run/played.lock)\n";
     const Case rgCases[] = {
         {"--help", 0},
@@ -209,7 +209,7 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         {"--stop", 0, "withdraw\n"},
         {"--stop", 0, "", false, false},
         {"--stop", 1, szStays, true},
-        {"--stop", 1, "withdraw\n12 s router could not be asked to take the mappings away; it may keep them\n", false,
+        {"--stop", 1, "withdraw\n62 s router could not be asked to take the mappings away; it may keep them\n", false,
          true, true}};
     std::filesystem::create_directories("/tmp/t");
     for (const Case& one : rgCases) {
