@@ -179,6 +179,7 @@ TEST_F(RuleMapping, ThereIsOneDaemonAtTheRouter) {
         EXPECT_EQ(mapper.Pass(true), 10);
         EXPECT_EQ(Result(), "80/tcp busy\n");
         EXPECT_EQ(std::exchange(mapper.mNAsked, 0), 6) << "for a minute";
+        gNClockStep = 2;
         Switch(false);
         EXPECT_EQ(mapper.Pass(true), 10);
         EXPECT_LE(mapper.mNAsked, 1) << "one that is switched off waits for nobody";
