@@ -87,6 +87,14 @@ std::string HardwareAddress(const std::string& szAddress) {
     return nl_addr2str(pHardware, szText.data(), szText.size());
 }
 
+bool IsOwnAddress(const std::string& szAddress) {
+    const Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    sockaddr_in own = {};
+    own.sin_family = AF_INET;
+    return inet_pton(AF_INET, szAddress.c_str(), &own.sin_addr) == 1 && own.sin_addr.s_addr != INADDR_ANY &&
+           bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)) == 0;
+}
+
 bool IsNeighbourThere(const std::string& szAddress, const std::function<bool()>& fnStop) {
     in_addr address = {};
     const NetlinkSocket pSocket = Connect();

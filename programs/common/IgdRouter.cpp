@@ -3,6 +3,8 @@
 
 #include <utility>
 
+#include "ground/net/Neighbour.h"
+
 namespace tavo {
 
 namespace {
@@ -78,7 +80,8 @@ RouterReply IgdRouter::Add(RouterMapping& mapping) {
 }
 
 RouterReply IgdRouter::Remove(const RouterMapping& mapping) {
-    return IgdReply(mIgd.Remove(mapping.szProtocol, mapping.nRouterPort));
+    const bool blOwn = mapping.szClient != mSzBox && IsOwnAddress(mapping.szClient);
+    return IgdReply(mIgd.Remove(mapping.szProtocol, mapping.nRouterPort, blOwn ? mapping.szClient : ""));
 }
 
 }  // namespace tavo

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "mapping/Router.h"
@@ -15,8 +16,8 @@ RouterReply IgdReply(int nCode);
 
 class IgdRouter : public Router {
 public:
-    // igd outlives it.
-    explicit IgdRouter(Igd& igd) : mIgd(igd) {}
+    // igd outlives it. szBox: the address that asks; one that the box still has beside it asks for what leads there.
+    explicit IgdRouter(Igd& igd, std::string szBox = "") : mIgd(igd), mSzBox(std::move(szBox)) {}
     Abilities What() const override;
     RouterReply List(std::vector<RouterMapping>& rgMappings) override;
     RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
@@ -27,6 +28,7 @@ public:
 
 private:
     Igd& mIgd;
+    std::string mSzBox;
 };
 
 }  // namespace tavo

@@ -1,6 +1,8 @@
 // See NatpmpRouter.h.
 #include "programs/natpmpd/NatpmpRouter.h"
 
+#include "ground/net/Neighbour.h"
+
 namespace tavo {
 
 namespace {
@@ -61,6 +63,11 @@ RouterReply NatpmpRouter::Add(RouterMapping& mapping) {
 }
 
 RouterReply NatpmpRouter::Remove(const RouterMapping& mapping) {
+    if (mapping.szClient != mSzBox && IsOwnAddress(mapping.szClient) && !mSilence) {
+        NatpmpClient other = mClient;
+        other.SetSource(mapping.szClient);
+        return Note(other.Unmap(mapping.szProtocol, mapping.nBoxPort));
+    }
     if (mapping.szClient != mSzBox) {
         return {Reply::kRefused, "the router keeps it for this box's former address " + mapping.szClient};
     }

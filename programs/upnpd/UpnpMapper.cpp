@@ -137,7 +137,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     KeepEvents(rgWanted, fnStop);
-    IgdRouter router(*mPIgd);
+    IgdRouter router(*mPIgd, Box());
     bool blChanged = false;
     Surroundings around = Around(Box(), fnStop, mMade);
     around.mapOthers = Others();
@@ -148,7 +148,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     };
     if (const auto pBefore = std::exchange(mPBefore, nullptr)) {
         SysLog(LOG_NOTICE, "the router's line at %s is used now", mPIgd->Service().control.Text().c_str());
-        IgdRouter before(*pBefore);
+        IgdRouter before(*pBefore, Box());
         BringInLine(before, {}, mMade.Get(), mHabit, around);
     }
     PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);

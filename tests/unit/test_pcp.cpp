@@ -208,13 +208,13 @@ TEST(NatpmpExchange, EndsAsItMustAndInTime) {
         const Peer peer(one.fnGateway, one.fnNeighbour);
         const auto start = Clock::now();
         const auto fnStop = [&] { return Clock::now() - start > one.stop; };
-        EXPECT_EQ(tavo::Exchange(gateway, rgGood, 1200ms, fnTake, fnStop), one.enEnd) << one.szWhat;
+        EXPECT_EQ(tavo::Exchange({}, gateway, rgGood, 1200ms, fnTake, fnStop), one.enEnd) << one.szWhat;
         const auto took = Clock::now() - start;
         EXPECT_TRUE(took >= one.least && took < one.most) << one.szWhat << " " << took / 1ms;
         EXPECT_EQ(peer.Questions(), one.nQuestions) << one.szWhat;
     }
     const auto start = Clock::now();
-    EXPECT_EQ(tavo::Exchange(gateway, rgGood, 5s, fnTake, {}), End::kUnreachable) << "nobody listens";
+    EXPECT_EQ(tavo::Exchange({}, gateway, rgGood, 5s, fnTake, {}), End::kUnreachable) << "nobody listens";
     EXPECT_LT(Clock::now() - start, 1s);
 }
 

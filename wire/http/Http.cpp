@@ -63,6 +63,7 @@ HttpEnd EndOf(CURLcode enCode) {
         case CURLE_COULDNT_CONNECT:
         case CURLE_COULDNT_RESOLVE_HOST:
         case CURLE_SEND_ERROR:
+        case CURLE_INTERFACE_FAILED:
             return HttpEnd::kUnreachable;
         default:
             return HttpEnd::kGarbage;
@@ -110,6 +111,7 @@ struct HttpClient::Impl {
     long nMostMilliseconds;
     long nLimitMilliseconds = nMostMilliseconds;
     std::function<bool()> fnStop;
+    std::string szSource;
     explicit Impl(int nMost) : nMostMilliseconds(nMost) {}
     ~Impl() { curl_easy_cleanup(pCurl); }
 };
@@ -124,6 +126,10 @@ void HttpClient::SetLimit(int nMilliseconds) {
 
 void HttpClient::SetStop(const std::function<bool()>& fnStop) {
     mPImpl->fnStop = fnStop;
+}
+
+void HttpClient::SetSource(const std::string& szAddress) {
+    mPImpl->szSource = szAddress.empty() ? "" : "host!" + szAddress;
 }
 
 HttpAnswer HttpClient::Get(const HttpUrl& url) {
@@ -157,6 +163,9 @@ void HttpClient::Prepare(const HttpUrl& url) {
     curl_easy_setopt(pCurl, CURLOPT_PROTOCOLS_STR, url.blTls ? "https" : "http");
     curl_easy_setopt(pCurl, CURLOPT_IPRESOLVE, CURL_IPRESOLVE_V4);
     curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
+    if (!mPImpl->szSource.empty()) {
+        curl_easy_setopt(pCurl, CURLOPT_INTERFACE, mPImpl->szSource.c_str());
+    }
     curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);
     curl_easy_setopt(pCurl, CURLOPT_TCP_NODELAY, 1L);

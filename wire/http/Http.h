@@ -53,6 +53,8 @@ public:
     }
     // The most that one request may take from now on.
     virtual void SetLimit(int /*nMilliseconds*/) {}
+    // Requests go out from this address of the box's from now on; empty: from whichever the way there has.
+    virtual void SetSource(const std::string& /*szAddress*/) {}
     // Requests end, as timeouts, within a second of the moment from which fnStop answers true.
     virtual void SetStop(const std::function<bool()>& /*fnStop*/) {}
 };
@@ -73,6 +75,7 @@ public:
                    const std::vector<std::string>& rgszHeaders) override;
     void SetLimit(int nMilliseconds) override;
     void SetStop(const std::function<bool()>& fnStop) override;
+    void SetSource(const std::string& szAddress) override;
 
 private:
     void Prepare(const HttpUrl& url);

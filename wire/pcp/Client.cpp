@@ -60,6 +60,10 @@ NatpmpClient::NatpmpClient(const std::string& szGateway, std::function<bool()> f
     }
 }
 
+void NatpmpClient::SetSource(const std::string& szAddress) {
+    inet_pton(AF_INET, szAddress.c_str(), &mSource);
+}
+
 int NatpmpClient::Ask(const NatpmpQuestion& question, NatpmpAnswer& answer) {
     if (!mGateway) {
         return kWireUnreachable;
@@ -69,7 +73,7 @@ int NatpmpClient::Ask(const NatpmpQuestion& question, NatpmpAnswer& answer) {
         answer = read.value_or(NatpmpAnswer());
         return read.has_value();
     };
-    const int nCode = CodeOf(Exchange(*mGateway, BytesOf(question), mLimit, fnTake, mFnStop), answer);
+    const int nCode = CodeOf(Exchange(mSource, *mGateway, BytesOf(question), mLimit, fnTake, mFnStop), answer);
     if (nCode == kWireOk && mFnEpoch) {
         mFnEpoch(answer.nEpoch);
     }

@@ -44,6 +44,8 @@ public:
     NatpmpClient(const std::string& szGateway, std::function<bool()> fnStop, std::function<void(uint32_t)> fnEpoch,
                  std::chrono::milliseconds limit = kNatpmpLimit);
 
+    // Asks from this address of the box's from now on.
+    void SetSource(const std::string& szAddress);
     // "0.0.0.0" from a gateway that has none now.
     int AskAddress(std::string& szAddress);
     // szProtocol: "TCP" or "UDP". The gateway may grant another router port and another lifetime.
@@ -55,6 +57,7 @@ public:
 private:
     int Ask(const NatpmpQuestion& question, NatpmpAnswer& answer);
 
+    in_addr mSource = {};
     std::optional<in_addr> mGateway;  // nothing where what was given is no address
     std::function<bool()> mFnStop;
     std::function<void(uint32_t)> mFnEpoch;

@@ -20,13 +20,17 @@ using std::chrono::milliseconds;
 constexpr milliseconds kFirstPause(250);
 constexpr milliseconds kMostPoll(100);  // so that a stop is seen soon
 
-Descriptor Connect(const in_addr& gateway) {
+Descriptor Connect(const in_addr& source, const in_addr& gateway) {
     Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    sockaddr_in from = {};
+    from.sin_family = AF_INET;
+    from.sin_addr = source;
     sockaddr_in to = {};
     to.sin_family = AF_INET;
     to.sin_addr = gateway;
     to.sin_port = htons(kGatewayPort);
-    if (connect(fd.Get(), reinterpret_cast<const sockaddr*>(&to), sizeof(to)) != 0) {
+    if (bind(fd.Get(), reinterpret_cast<const sockaddr*>(&from), sizeof(from)) != 0 ||
+        connect(fd.Get(), reinterpret_cast<const sockaddr*>(&to), sizeof(to)) != 0) {
         fd.Reset();
     }
     return fd;
@@ -40,9 +44,9 @@ void WaitUntil(int fd, Clock::time_point when) {
 
 }  // namespace
 
-ExchangeEnd Exchange(const in_addr& gateway, std::span<const uint8_t> rgQuestion, milliseconds limit,
-                     const std::function<bool(std::span<const uint8_t>)>& fnTake, const std::function<bool()>& fnStop) {
-    const Descriptor fd = Connect(gateway);
+ExchangeEnd Exchange(const in_addr& source, const in_addr& gateway, std::span<const uint8_t> rgQuestion,
+                     milliseconds limit, const std::function<bool(std::span<const uint8_t>)>& fnTake, const std::function<bool()>& fnStop) {
+    const Descriptor fd = Connect(source, gateway);
     const Clock::time_point end = Clock::now() + limit;
     Clock::time_point nextSending = Clock::now();
     milliseconds pause = kFirstPause;

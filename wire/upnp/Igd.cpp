@@ -272,8 +272,11 @@ int Igd::Add(const IgdEntry& mapping) {
         .Code();
 }
 
-int Igd::Remove(const std::string& szProtocol, uint16_t nRouterPort) {
-    return Call("DeletePortMapping", Key(szProtocol, nRouterPort)).Code();
+int Igd::Remove(const std::string& szProtocol, uint16_t nRouterPort, const std::string& szSource) {
+    mPHttp->SetSource(szSource);
+    const int nCode = Call("DeletePortMapping", Key(szProtocol, nRouterPort)).Code();
+    mPHttp->SetSource("");
+    return nCode;
 }
 
 }  // namespace tavo

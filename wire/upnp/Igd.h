@@ -81,7 +81,8 @@ public:
     int ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast, std::vector<IgdEntry>& rgMappings);
     int Get(const std::string& szProtocol, uint16_t nRouterPort, IgdEntry& mapping);
     int Add(const IgdEntry& mapping);
-    int Remove(const std::string& szProtocol, uint16_t nRouterPort);
+    // szSource: the address of the box's that asks, as many routers let nobody but the client itself; empty: any.
+    int Remove(const std::string& szProtocol, uint16_t nRouterPort, const std::string& szSource = "");
 
     const IgdService& Service() const { return mService; }
     // The description has others beside it.
