@@ -385,6 +385,13 @@ TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
         EXPECT_NE((core.record.Here().contains({"TCP", 50})), row.blApplies);
         EXPECT_FALSE((core.record.Here().contains({"TCP", 30}))) << "what could not be made is nothing of ours";
         EXPECT_EQ((core.record.Here()[{"TCP", 10}].nMore), 1);
+        if (row.blApplies && row.nTornAway == 0) {
+            router.mNCalls = 0;
+            core.Run(router, {Entry(20, 20, "", "tavo:c")});
+            router.mNCalls = 0;
+            core.Run(router, {Entry(20, 20, "", "tavo:c")});
+            EXPECT_EQ(router.mNCalls, 2) << "the list, and one look once that is applied";
+        }
     }
 }
 
@@ -540,6 +547,10 @@ TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
         EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
         EXPECT_EQ(router.mMapTable.size(), 1U) << "another host has it by now";
         EXPECT_TRUE(core.record.Here().empty());
+        router.mNGetCode = tavo::kWireTimeout;
+        router.mNCalls = 0;
+        core.Run(router, Wanted(3));
+        EXPECT_EQ(router.mNCalls, nListCode == 401 ? 3 : 2) << "two answers in a row that do not come end a pass";
     }
 }
 
@@ -653,6 +664,20 @@ TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
     }
 }
 
+TEST(Mapping, WhatAnotherHostTookMeanwhileIsItsOwn) {
+    class Robbed : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            Put(Entry(mapping.nRouterPort, 9, "192.168.1.9", "game"));
+            return {};
+        }
+    };
+    Robbed router;
+    Core core;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 718 192.168.1.9 game"});
+    EXPECT_TRUE(core.record.Here().empty());
+}
+
 // With a text of its own, by which nobody knows whose it is.
 TEST(Mapping, WhatIsShownOnlyAfterAWhileIsOurs) {
     class Slow : public MemoryRouter {
@@ -730,15 +755,18 @@ TEST(Mapping, ATextThatTheRouterGivesToEverybodysProvesNothing) {
 }
 
 TEST(Mapping, AStopInTheMiddleLosesNothing) {
-    MemoryRouter router;
-    tavo::Record record("", "boot");
-    tavo::Habits habit;
-    record.TurnTo({"192.168.1.1", ""});
-    const auto result = tavo::BringInLine(
-        router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
-        {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] { return true; }});
-    EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
-    EXPECT_TRUE(record.Here().contains({"TCP", 1}));
+    for (const bool blPermanentOnly : {false, true}) {
+        MemoryRouter router;
+        tavo::Record record("", "boot");
+        tavo::Habits habit{.blPermanentOnly = blPermanentOnly};
+        record.TurnTo({"192.168.1.1", ""});
+        const auto result = tavo::BringInLine(
+            router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
+            {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] { return true; }});
+        EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
+        EXPECT_TRUE(record.Here().contains({"TCP", 1}));
+        EXPECT_EQ(record.Here().at({"TCP", 2}).nLease, blPermanentOnly ? 0U : 3600U) << "as it is to be asked for";
+    }
 }
 
 // A port whose answer was lost does not wait for the next check, which may be an hour away.
@@ -1067,6 +1095,82 @@ TEST(Mapping, WhatMayHaveBeenLentIsTakenAwayBeforeItsPlaceIsUsedAnew) {
     EXPECT_EQ(router.Table(), "7-5:3 ");
 }
 
+// It knows a mapping by the port of the box: one place for each, and the older one first has to go.
+TEST(Mapping, APortOfTheBoxIsLentAtOnePlaceOnly) {
+    LendingRouter router;
+    Core core;
+    auto result = core.Run(router, {Entry(6, 3, "", "tavo:a"), Entry(7, 3, "", "tavo:b")});
+    EXPECT_EQ(WhyOf(result.rgOutcomes[1].verdict),
+              "another rule has this port of the box; the router gives it one router port only");
+    EXPECT_EQ(router.Table(), "6-5:3 ");
+    router.mBlLoseRemove = true;
+    result = core.Run(router, {Entry(7, 3, "", "tavo:b"), Entry(8, 4, "", "tavo:c")});
+    EXPECT_EQ(Texts(result),
+              (Rows{"7/tcp the router has not closed port 6 yet", "8/tcp 1 anew", "6/tcp timeout left over"}));
+    EXPECT_EQ(result.rgOutcomes[0].verdict.enState, tavo::PortState::kWaiting);
+    EXPECT_EQ(result.nNextSeconds, 10);
+    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:b")})), Rows{"7/tcp 1 anew"});
+    EXPECT_EQ(router.Table(), "7-5:3 ");
+}
+
+// Routers of the first generation take no lease: some say so, and some call it bad arguments, as other things too.
+TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
+    using tavo::Reply;
+    struct Scripted : MemoryRouter {
+        RouterReply Add(RouterMapping& mapping) override {
+            rgLeases.push_back(mapping.nLease);
+            mapping.nRouterPort = 9;  // only what is said last counts
+            return {rgReplies.at(rgLeases.size() - 1)};
+        }
+        std::vector<Reply> rgReplies;
+        std::vector<uint32_t> rgLeases;
+    };
+    using Leases = std::vector<uint32_t>;
+    for (const auto& [blKnown, rgReplies, rgLeases, blPermanentOnly] :
+         {std::tuple(false, std::vector{Reply::kOk}, Leases{3600}, false),
+          {false, {Reply::kOnlyPermanent, Reply::kOk}, {3600, 0}, true},
+          {false, {Reply::kOnlyPermanent, Reply::kTimeout}, {3600, 0}, true},
+          {false, {Reply::kBadArguments, Reply::kOk}, {3600, 0}, true},
+          {false, {Reply::kBadArguments, Reply::kBadArguments}, {3600, 0}, false},
+          {false, {Reply::kConflict}, {3600}, false},
+          {true, {Reply::kBadArguments}, {0}, true}}) {
+        Scripted router;
+        router.rgReplies = rgReplies;
+        tavo::Habits habit{.blPermanentOnly = blKnown};
+        RouterMapping mapping = Entry(1, 1, kBox, "tavo:a");
+        EXPECT_EQ(AddWithLease(router, mapping, habit).enReply, rgReplies.back());
+        EXPECT_EQ(router.rgLeases, rgLeases);
+        EXPECT_EQ(std::pair(mapping.nLease, mapping.nRouterPort), std::pair(rgLeases.back(), uint16_t{9}));
+        EXPECT_EQ(habit.blPermanentOnly, blPermanentOnly);
+    }
+}
+
+// Of a router that has restarted, of one that is doubtful, and with time.
+TEST(Mapping, WhatIsKnownOfARouterIsForgottenAsFarAsItMayBeWrong) {
+    // What comes of two rows, the box's and one of a former address, and whether a place elsewhere is known still.
+    for (const auto& [blRestarted, blDoubtful, nLater, szRows, blElsewhere] :
+         {std::tuple(false, false, 1800, "1 shown, 2 shown, ", true),
+          {false, false, 1801, "1 shown, 2 shown, ", false},
+          {false, true, 0, "1 shown due, 2 shown due, ", false},
+          {true, false, 0, "1, ", true},
+          {true, true, 0, "1, ", false}}) {
+        tavo::Record record("", "boot");
+        record.TurnTo({"192.168.1.1", ""});
+        record.Here() = {{{"TCP", 1}, {kBox, 1, "tavo:a", true, 3600, 1000}},
+                         {{"TCP", 2}, {"192.168.1.4", 2, "tavo:a", true, 3600, 1000}}};
+        tavo::Habits habit{.mapElsewhere = {{{"TCP", 3}, "offered 4"}}, .nElsewhereSince = 1000};
+        Forget(record, habit, kBox, blRestarted, blDoubtful, 1000 + nLater);
+        std::string szLeft;
+        for (const auto& [key, made] : record.Here()) {
+            szLeft +=
+                std::to_string(key.second) + (made.blShown ? " shown" : "") + (made.blBefore ? " due" : "") + ", ";
+        }
+        EXPECT_EQ(szLeft, szRows);
+        EXPECT_EQ(habit.mapElsewhere.size(), blElsewhere ? 1U : 0U);
+        EXPECT_EQ(habit.nElsewhereSince, blElsewhere ? 1000 : 1000 + nLater);
+    }
+}
+
 // Often after a change, seldom in peace; a router that fails is looked for anew at every third time.
 TEST(Keeper, LooksSoonAfterAChangeAndSeldomInPeace) {
     struct Pass {
@@ -1153,6 +1257,12 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     later.TurnTo({"192.168.1.1", "cc:dd"});
     EXPECT_EQ(later.Here().size(), 2U) << "these never end";
     EXPECT_EQ((later.Here()[{"BOTH", 65000}].nMore), 535);
+    tavo::Record older(
+        "[boot]\nid=x\n\n[r]\ngateway=10.9.9.9\nprotocol=TCP\nrouter_port=1\nbox_port=1\n"
+        "client=192.168.1.5\nother_port=9\n",
+        "x");
+    older.TurnTo({"10.9.9.9", ""});
+    EXPECT_EQ(older.Here().at({"TCP", 1}).other, (tavo::Target{kBox, 9})) << "earlier versions knew of no other client";
     EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
 }
 
