@@ -30,6 +30,7 @@ struct Network {
     std::function<void()> fnChild = [] {};  // first thing that the detection's child does
     int nServiceRestart = 0;
     int nRouterDbUpdates = 0;
+    int nRouterDbUpdate = 1;  // what each answers
     std::function<void()> fnRouterDbUpdate = [] {};
     std::optional<std::string> szAnnounced;
     std::function<void()> fnAnnounce;  // what else happens when avahi restarts

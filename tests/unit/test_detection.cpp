@@ -67,6 +67,11 @@ protected:
 TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     EXPECT_EQ(DetectCache::ToString(static_cast<__TAG_TAVO_ROUTER_INIT_STATE>(4)), "");
     EXPECT_TRUE(Logged("non supported enState=4"));
+    EXPECT_EQ(DetectCache::ToString(TAVO_ROUTER_INIT_STATE_UNKNOWN) +
+                  DetectCache::ToString(TAVO_ROUTER_INIT_STATE_NOT_INITIALIZED) +
+                  DetectCache::ToString(TAVO_ROUTER_INIT_STATE_UPNP_NATPMP) +
+                  DetectCache::ToString(TAVO_ROUTER_INIT_STATE_MANUAL),
+              "unknownnot_initializedupnp_natpmpmanual");
     EXPECT_EQ(CleanDetectManualCache(), 1);
     ASSERT_EQ(SetDetectManualCache("10.0.0.1", "A", "B", "C"), 1);
     ASSERT_EQ(SetDetectManualCache("192.168.1.1", "x\"; [10.0.0.1]\n", "R1", "2"), 1);
@@ -105,6 +110,9 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
         EXPECT_EQ(SetDetectManualCache("192.168.1.1", "never", "kept", "3"), 0) << szFail;
         EXPECT_TRUE(Logged(szLine)) << szLine;
     }
+    gLog.clear();
+    EXPECT_EQ(DetectCacheReader("192.168.1.1").IsSectionExisted(blExisted), 0);
+    EXPECT_EQ(gLog, (std::vector<std::string>{"hash malloc failed", "Init() failed"}));
     gStage = Stage();
     EXPECT_EQ(Read(SZF_DETECT_MANUAL_CACHE).find("never"), std::string::npos);
 
@@ -116,6 +124,7 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=Manual\n");
     DetectCacheReader odd("192.168.1.1");
     ASSERT_EQ(odd.Init(), 1);
+    EXPECT_EQ(odd.Init(), 1) << "loaded already";
     EXPECT_EQ(odd.GetType(enState), 0);
     EXPECT_TRUE(Logged("invalid szValue=Manual"));
     EXPECT_EQ(odd.GetModel(szText), 0);
@@ -127,6 +136,8 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
     EXPECT_TRUE(Logged("Init() failed") && LoggedFrom("TLIBCFileGetSection(" + SZF_DETECT_MANUAL_CACHE));
     EXPECT_EQ(broken.IsSectionExisted(blExisted), 0);  // loaded once, and for good
     EXPECT_TRUE(Logged("initialize failed"));
+    EXPECT_EQ(broken.GetBrand(szText), 0);
+    EXPECT_TRUE(Logged("can not GetBrand(), mEnReaderState=failed"));
 }
 
 // ---- the detectors ---------------------------------------------------------------------------------------
@@ -185,6 +196,17 @@ TEST_F(Detection, MissingDescriptionIsFetchedOnceAndALockedDetectionChangesNothi
     EXPECT_TRUE(detector.Start());
     EXPECT_EQ(detector.GetPfPath(), "Acme: R1(1.0)");
     EXPECT_EQ(mNetwork.nRouterDbUpdates, 2);
+    for (const int nUpdated : {0, 7, -1}) {
+        mNetwork.nRouterDbUpdate = nUpdated;
+        int nVersion = 5;
+        EXPECT_EQ(TLibUpdateRouterDBList(&nVersion), nUpdated < 0 ? 0 : 1);
+        EXPECT_EQ(nVersion, nUpdated);
+    }
+    mNetwork.fnRouterDbUpdate = [] {};
+    std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme");
+    EXPECT_TRUE(detector.Start());
+    EXPECT_EQ(detector.GetPfPath(), "");
+    EXPECT_TRUE(Logged("update router db failed") && Logged("pfPath does not exist"));
 
     int fd = -1;
     ASSERT_EQ(lock_file("/tmp/upnp_detector.lock", fd), 1);

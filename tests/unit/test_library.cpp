@@ -86,6 +86,12 @@ TEST_F(Library, RuleArrays) {
     EXPECT_STREQ(pRules[1].szServiceName, "web");  // carried over
     EXPECT_STREQ(pRules[1].szServiceID, "");
     EXPECT_STREQ(pRules[1].szRouterPort, "4");
+    Write("/etc/portforward/testrule.conf", "[9]\nenabled=1\ns_port=5\nr_port=6\nprotocol name=tcp\n");
+    Rule* pTestRules = nullptr;
+    ASSERT_EQ(TLibGetRulesArrFromTestRuleConf(&nRules, &pTestRules, nullptr, true, nullptr), 0);
+    EXPECT_EQ(std::to_string(nRules) + pTestRules[0].szRuleID, "19");
+    TLibFreeRulesArr(pTestRules);
+    std::filesystem::remove("/etc/portforward/testrule.conf");
     EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr), -1);
     EXPECT_TRUE(Logged("pRgRules is NULL or *pRgRules is not NULL"));
     TLibFreeRulesArr(pRules);
@@ -146,7 +152,7 @@ TEST_F(Library, ARuleIsToldWholeOrNotAtAll) {
         {"enabled=1\ns_port=1\nprotocol name=tcp\n", "get rule port failed"},
         {"enabled=1\nr_port=1\nprotocol name=tcp\n", "get rule port failed"}};
     for (const auto& [szText, szTold] : rgCases) {
-        Write(kRuleConf, std::string("[7]\n") + szText);
+        Write(kRuleConf, std::string("[7]\nservice=web\n") + szText);
         RouterRuleConfReader reader(false);
         ASSERT_EQ(reader.StartNextRule(), 1);
         TAVO_PF_CONF* pConf = TAVOPFRuleGet();
@@ -162,7 +168,8 @@ TEST_F(Library, ARuleIsToldWholeOrNotAtAll) {
                                    : gLog.back(),
                       szTold);
             EXPECT_EQ(nResult, gLog.empty() ? 1 : 0);
-            EXPECT_TRUE(blReader || szId == "7");
+            EXPECT_EQ(reader.GetRuleID(szId) + reader.GetRuleServiceName(szExtra), 2);
+            EXPECT_EQ(szId + szExtra, "7web");
         }
         TAVOPFConfFree(pConf);
         int nRules = 7;
@@ -216,6 +223,7 @@ TEST_F(Library, WhatIsMissingIsRefusedAndNamed) {
         {[&] { return PF_CONF::FreeArray(nullptr); }, 0, "pConfHead is NULL"},
         {[] { return RouterRuleConfWriter().GetRuleConf(nullptr); }, 0, "pRuleConfHead is NULL"},
         {[] { return TestFuncToPorts(nullptr, 8, nullptr); }, -1, "szNumbers is NULL"},
+        {[] { return TestFuncToPorts(nullptr, 8, "10"); }, -1, "ToPorts() failed"},
     };
     for (const auto& [fnCall, nResult, szLine] : rgCases) {
         gLog.clear();
@@ -390,6 +398,11 @@ TEST_F(Library, RuleFileIsPutBackWhenTheWriteFails) {
     EXPECT_TRUE(LoggedFrom("rename(/etc/portforward/rule.conf, /etc/portforward/rule.conf"));
     EXPECT_EQ(Read(kRuleConf), "[9]\nenabled=1\n");
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator("/etc/portforward"), {}), 1);
+    int nRules = 0;
+    Rule* pRules = nullptr;
+    ASSERT_EQ(writer.ToArray(nRules, &pRules), 1);
+    EXPECT_EQ(std::to_string(nRules) + pRules->szRuleID + pRules->szServiceName, "17web");
+    TLibFreeRulesArr(pRules);
     EXPECT_EQ(writer.Sync(), 1);
     EXPECT_NE(Read(kRuleConf).find("[7]\nenabled=\"1\"\ns_port=\"2\"\nr_port=\"1\"\n"), std::string::npos);
 }
@@ -508,6 +521,7 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=no\nmax=x\n", "no no 0 0 0", -1},
         {"192.168.1.9", "support_router_upnp=yes\nsupport_router_natpmp=yes\nmax=5\n", "- - - - -", 0},
         {"no address", "support_router_upnp=no\nsupport_router_natpmp=no\n", "- - - - -", -1},
+        {"192.168.1.1", "brand=x\n", "  0 0 -", 0},
     };
     for (const auto& stored : rgCases) {
         Write(kRouterConf, std::string("[192.168.1.1]\n") + stored.szStored);
@@ -526,6 +540,10 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
             szWords += (i == 0 ? "" : " ") + (rgAnswers[i] == 1 ? rgszTold[i] : "-");
         }
         EXPECT_EQ(szWords, stored.szWords) << stored.szStored;
+        std::string szName;
+        const bool blFound = reader.GetSectionName(szName) == 1;
+        EXPECT_EQ(szName, blFound ? "192.168.1.1" : "");
+        EXPECT_EQ(blFound, szName == stored.szAddress);
         for (const char* szLine : {"get support upnp fail", "get support natpmp fail"}) {
             EXPECT_EQ(Logged(szLine), szWords == "- - - - -") << szLine;
         }

@@ -79,7 +79,7 @@ int TAVOPFRouterDBUpdate() {
     }
     ++gPNetwork->nRouterDbUpdates;
     gPNetwork->fnRouterDbUpdate();
-    return 1;
+    return gPNetwork->nRouterDbUpdate;
 }
 }
 
