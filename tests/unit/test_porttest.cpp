@@ -6,6 +6,7 @@
 
 #include "porttest/RuleVerdict.h"
 #include "programs/tavoportcheckd/Limits.h"
+#include "programs/tavoportcheckd/Prober.h"
 #include "tavo/porttest.h"
 #include "webserver.h"
 #include "wire/portcheck/Checker.h"
@@ -168,6 +169,62 @@ TEST(Checker, IsAskedAndItsAnswerReadOrTheReasonGiven) {
         }
     }
     EXPECT_NE(tavo::Checker({"ftp://h", "t", 1, 1}).Ask({}, "p", "a", 400).szReason, "");
+    EXPECT_EQ(tavo::Checker({"http://127.0.0.1:1", "t", 1, 1}).Ask({}, "p", "a", 400).szReason,
+              "the port checker cannot be reached by IPv4");
+}
+
+// On loopback: who answers, who only listens, and nobody.
+TEST(Prober, SaysOfEachPortWhatCameBack) {
+    struct Listener {
+        explicit Listener(int nKind) : fd(socket(AF_INET, nKind | SOCK_CLOEXEC, 0)) {
+            sockaddr_in own = {};
+            own.sin_family = AF_INET;
+            own.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+            socklen_t nLength = sizeof(own);
+            bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength);
+            listen(fd.Get(), 1);
+            getsockname(fd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength);
+            nPort = ntohs(own.sin_port);
+        }
+        // One challenge, by whoever sends it, on a socket of its own or on this one.
+        void Answer(int fdHere) const {
+            char szText[64] = {};
+            sockaddr_in peer = {};
+            socklen_t nLength = sizeof(peer);
+            recvfrom(fdHere, szText, sizeof(szText) - 1, 0, reinterpret_cast<sockaddr*>(&peer), &nLength);
+            EXPECT_EQ(szText, "ask:" + std::to_string(nPort) + "\n");
+            const std::string szAnswer = "answer:" + std::to_string(nPort) + "\n";
+            sendto(fdHere, szAnswer.data(), szAnswer.size(), 0, reinterpret_cast<sockaddr*>(&peer), nLength);
+        }
+        tavo::Descriptor fd;
+        uint16_t nPort = 0;
+    };
+    const Listener tcp(SOCK_STREAM), quiet(SOCK_STREAM), udp(SOCK_DGRAM), mute(SOCK_DGRAM);
+    std::thread answers([&] {
+        udp.Answer(udp.fd.Get());
+        tcp.Answer(tavo::Descriptor(accept(tcp.fd.Get(), nullptr, nullptr)).Get());
+    });
+    const auto fnProbe = [](const std::vector<tavo::CheckedPort>& rgPorts, int fdStop) {
+        const auto result = tavo::ProbePorts(*tavo::Address::Parse("127.0.0.1"), rgPorts, "ask", "answer", fdStop);
+        std::string szFound;
+        for (size_t i = 0; i < result.rgFindings.size(); ++i) {
+            const tavo::PortFinding& finding = result.rgFindings[i];
+            szFound += tavo::kPortStateWords[static_cast<size_t>(finding.enState)];
+            szFound += std::string(finding.blAnswered ? " answered" : "") + (finding.nSource != 0 ? " from" : "") +
+                       (result.rgHeld[i].Get() >= 0 ? " held" : "") + "; ";
+        }
+        return szFound;
+    };
+    int rgStop[2] = {};
+    ASSERT_EQ(pipe(rgStop), 0);
+    const tavo::Descriptor fdStop(rgStop[0]);
+    tavo::Descriptor fdStopper(rgStop[1]);
+    EXPECT_EQ(fnProbe({{true, tcp.nPort, true}, {true, quiet.nPort}, {true, 1}, {false, udp.nPort}, {false, 1}},
+                      fdStop.Get()),
+              "open answered from held; open from held; refused from; open answered from; refused from; ");
+    answers.join();
+    fdStopper.Reset();
+    EXPECT_EQ(fnProbe({{false, mute.nPort}}, fdStop.Get()), "untold from; ") << "there was no time";
 }
 
 TEST(PortTester, TheMarkerIsOursWhateverStoodThere) {
