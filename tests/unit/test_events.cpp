@@ -208,6 +208,12 @@ TEST_F(EventsTest, ARouterThatWillNotIsLeftAloneForAWhile) {
     mPRouter->Grant({"SID: " + std::string(257, 'x')});
     fnAsk("a name without end");
     fnAsk("silent");
+    mEvents.TurnTo(kService, "198.41.0.4");  // no address of this box: there is nothing to ask for
+    mEvents.Keep(mNow, {});
+    EXPECT_TRUE(!mEvents.IsSubscribed() && mPRouter->TakeAsked().empty());
+    mEvents.TurnTo(kService, kRouter);
+    mEvents.Keep(mNow, {});
+    EXPECT_EQ(mPRouter->TakeAsked().size(), 1U);
     mPRouter->Grant({"SID: " + std::string(256, 'x')});
     mEvents.Keep(mNow + 10min - 1s, {});
     EXPECT_FALSE(mEvents.IsSubscribed());
@@ -471,6 +477,36 @@ TEST(HttpRequest, IsReadToABoundAndToAStop) {
             late.join();
         }
         EXPECT_LT(std::chrono::steady_clock::now() - start, 1s);
+    }
+}
+
+// A slow reader gets the whole of an answer, though it said more than was read; one that does not read is given up.
+TEST(BoundedSocket, AnAnswerIsWholeOrGivenUp) {
+    const std::string szAnswer(4U << 20U, 'x');
+    for (const bool blReads : {true, false}) {
+        int rgFds[2] = {};
+        int rgStop[2] = {};
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds) + pipe(rgStop), 0);
+        const tavo::Descriptor fdHere(rgFds[0]), fdStop(rgStop[0]);
+        tavo::Descriptor fdThere(rgFds[1]), fdStopper(rgStop[1]);
+        send(fdThere.Get(), "more", 4, 0);
+        size_t nRead = 0;
+        std::thread reader([&] {
+            std::vector<char> rgBytes(1U << 16U);
+            for (ssize_t nNow = 1; blReads && nNow > 0; nRead += static_cast<size_t>(nNow)) {
+                nNow = recv(fdThere.Get(), rgBytes.data(), rgBytes.size(), 0);
+            }
+            blReads ? fdThere.Reset() : fdStopper.Reset();
+        });
+        const auto start = std::chrono::steady_clock::now();
+        tavo::BoundedSocket bounded(fdHere.Get(), fdStop.Get());
+        bounded.Write(szAnswer);
+        bounded.Finish();
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 900ms);
+        reader.join();
+        EXPECT_EQ(nRead, blReads ? szAnswer.size() : 0);
+        char cRest = 0;
+        EXPECT_EQ(recv(fdHere.Get(), &cRest, 1, MSG_DONTWAIT), blReads ? 0 : 1);
     }
 }
 

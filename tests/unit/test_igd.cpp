@@ -407,6 +407,7 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
     const std::tuple<std::vector<std::pair<int, std::string>>, int, size_t> rgCases[] = {
         {{{1, szOne}, {2, szOne}}, tavo::kWireOk, 2},
         {{{1, szOne}, {1, szTwo}, {2, szOne}}, tavo::kWireOk, 2},
+        {{{1, szOne}, {0x10000, szOne}, {3, "evil"}, {2, szOne}}, tavo::kWireOk, 2},  // what makes no sense, too
         {{{1, szOne}, {1, szOne}, {2, szOne}}, tavo::kWireTooLong, 1}};
     for (const auto& [rgEntries, nCode, nShown] : rgCases) {
         const auto pHttp = std::make_shared<Table>();

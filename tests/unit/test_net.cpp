@@ -3,6 +3,11 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <cstdio>
+#include <ctime>
+#include <fstream>
+#include <string>
+#include <vector>
 
 #include "ground/net/Level.h"
 #include "ground/net/Neighbour.h"
@@ -167,6 +172,38 @@ TEST(HopProbe, ShowsTheHostItselfAtEveryDistanceAndKeepsItsBounds) {
         }
     }
     EXPECT_LT(least.count(), 0.2) << "it asks at once, and not only again";
+}
+
+// At the other end of the link there is nobody.
+TEST(HopProbe, AsksAgainAndWaitsUntilItsLimit) {
+    for (const char* szStep :
+         {"ip link add v0 type veth peer name v1", "ip link set v1 up", "ip address add 10.77.0.1/24 dev v0",
+          "ip link set v0 up", "ip neigh add 10.77.0.2 lladdr 00:11:22:aa:bb:cc dev v0"}) {
+        ASSERT_EQ(TLIBCSystem(szStep), 0) << szStep;
+    }
+    const auto fnSent = [] {
+        std::ifstream counts("/proc/net/snmp");
+        std::vector<int> rgSent;
+        for (std::string szLine; std::getline(counts, szLine);) {
+            int nSent = 0;
+            if (std::sscanf(szLine.c_str(), "Udp: %*d %*d %*d %d", &nSent) == 1) {
+                rgSent.push_back(nSent);
+            }
+        }
+        return rgSent.at(0);
+    };
+    for (const auto& [nLimit, nAskings] : {std::pair(150, 1), {450, 2}, {900, 3}}) {
+        const int nSent = fnSent();
+        const auto start = std::chrono::steady_clock::now();
+        const std::clock_t nBusy = std::clock();
+        const auto rgFound = tavo::WalkTowards(Address("10.77.0.2"), 2, 3, nLimit);
+        EXPECT_LT(std::clock() - nBusy, CLOCKS_PER_SEC / 10) << "it sleeps";
+        const auto took = std::chrono::steady_clock::now() - start;
+        EXPECT_TRUE(took >= std::chrono::milliseconds(nLimit) && took < std::chrono::milliseconds(nLimit + 200));
+        EXPECT_TRUE(rgFound.size() == 2 && !rgFound[0] && !rgFound[1]);
+        EXPECT_EQ(fnSent() - nSent, 2 * nAskings) << nLimit;
+    }
+    EXPECT_EQ(TLIBCSystem("ip link del v0"), 0);
 }
 
 TEST(NetworkWatch, SaysThatSomethingHasChangedAndThenNoMore) {

@@ -292,6 +292,7 @@ TEST(GatewayAnnouncements, AreTheGatewaysOwn) {
 }
 
 TEST(NatpmpClient, AsksForWhatItIsToldTo) {
+    EXPECT_EQ(tavo::NatpmpClient(kGateway, {}, {}, 300ms).Unmap("UDP", 1), tavo::kWireUnreachable) << "nobody listens";
     {
         const Peer peer([](int) {
             return std::vector<Bytes>{{0, 130, 0, 0, 0, 0, 0, 9, 0x13, 0x89, 0x13, 0x8A, 0, 0, 0, 60}};

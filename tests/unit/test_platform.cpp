@@ -219,7 +219,8 @@ TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
     EXPECT_EQ(tavo::ParseSections("[a]\nk=\"\\x09\\x4a\\x4A\\xAf\"\n")->front().rgPairs[0].szValue, "\tJJ\xaf");
     for (const char* szBad :
          {"k=v\n", "[a]\nnonsense\n", "[a]\nk=\"open\n", "[a]\nk=\"\\q\"\n", "[a]\nk=\"x\" y\n", "[a]\nk=\"\\x00\"\n",
-          "[a]\n=v\n", "[a]\nk=\"\\x4\"\n", "[a]\nk=\"\\x4g\"\n", "[a]\nk=\"\\x@1\"\n", "[a]\nk=\"x\\\"\n"}) {
+          "[a]\n=v\n", "[a]\nk=\"\\x4\"\n", "[a]\nk=\"\\x4g\"\n", "[a]\nk=\"\\x@1\"\n", "[a]\nk=\"x\\\"\n",
+          "[a]\nk\\=v\n", "[a\\]\nk=v\n", "[a\\q]\nk=v\n"}) {
         EXPECT_FALSE(tavo::ParseSections(szBad)) << szBad;
     }
 }
