@@ -124,8 +124,9 @@ struct Core {
         return tavo::BringInLine(router, rgWanted, record, habit,
                                  {szBox, [this] { return nNow; }, [this] { return nStopIn > 0 && --nStopIn == 0; },
                                   [this] { return ++nSaves > 0 && !blDiskFull; },
-                                  [this](const RouterMapping&, const tavo::Step&) { ++nTold; }});
+                                  [this](const RouterMapping&, const tavo::Step&) { ++nTold; }, mapOthers});
     }
+    std::map<tavo::MappingKey, uint16_t> mapOthers;
     std::string szBox = kBox;
     tavo::Record record{"", "boot"};
     tavo::Habits habit;
@@ -499,6 +500,42 @@ TEST(Mapping, AYesToARemovalIsLookedAt) {
         EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
         EXPECT_FALSE((core.record.Here().contains({"TCP", 1})));
     }
+}
+
+// What another daemon of this box sees to by now is not taken away, but where it leads elsewhere.
+TEST(Mapping, WhatAnotherDaemonSeesToStays) {
+    for (const uint16_t nBoxPort : {uint16_t{1}, uint16_t{9}}) {
+        MemoryRouter router;
+        Core core;
+        core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        core.mapOthers = {{{"TCP", 1}, nBoxPort}};
+        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+        EXPECT_EQ(router.mMapTable.size(), nBoxPort == 1 ? 1U : 0U);
+    }
+}
+
+// One answer that does not come is asked for again, or leaves open what came of a removal.
+TEST(Mapping, ALookThatIsNotAnsweredSaysNothing) {
+    struct Mute : MemoryRouter {
+        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
+            return nSilent > 0 && nSilent-- > 0 ? IgdReply(tavo::kWireTimeout)
+                                                : MemoryRouter::Get(szProtocol, nPort, mapping);
+        }
+        int nSilent = 0;
+    };
+    Mute router;
+    Core core;
+    router.mNListCode = 401;
+    router.nSilent = 1;
+    EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1 anew"});
+    router.mNListCode = tavo::kWireOk;
+    router.Put(Entry(2, 2, "192.168.1.9", "game"));
+    router.Put(Entry(3, 3, "192.168.1.9", "game"));
+    router.nSilent = 1;
+    EXPECT_EQ(Texts(core.Run(router, {})), Rows{"1/tcp timeout left over"});
+    EXPECT_TRUE(core.record.Here().contains({"TCP", 1}));
+    EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
+    EXPECT_TRUE(core.record.Here().empty());
 }
 
 TEST(Mapping, ALookAtManyRemovalsCostsLittle) {
@@ -1143,6 +1180,12 @@ TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
         EXPECT_EQ(std::pair(mapping.nLease, mapping.nRouterPort), std::pair(rgLeases.back(), uint16_t{9}));
         EXPECT_EQ(habit.blPermanentOnly, blPermanentOnly);
     }
+    // What may be there without a lease never ends by itself.
+    Scripted router;
+    router.rgReplies = {Reply::kOnlyPermanent, Reply::kTimeout};
+    Core core;
+    core.Run(router, {Entry(1, 1, "", "tavo:a")});
+    EXPECT_EQ(core.record.Here().at({"TCP", 1}).nLease, 0U);
 }
 
 // Of a router that has restarted, of one that is doubtful, and with time.

@@ -228,6 +228,7 @@ TEST(Notices, EachOutcomeHasItsReason) {
         verdict.szWhy = "as it was";
         EXPECT_EQ(tavo::WhyOf(verdict), "as it was");
     }
+    EXPECT_EQ(WhyOf(tavo::RouterState::kUnreachable, "UPnP"), "nobody answers at the router's address");
     tavo::RouterMapping mapping{"UDP", 65000, 1, "", "", 0, true};
     EXPECT_EQ(tavo::MappingName(mapping), "65000/udp");
     mapping.nMore = 535;
