@@ -218,6 +218,9 @@ TEST_F(Library, WhatIsMissingIsRefusedAndNamed) {
         {[&] { return SplitRouterName(nullptr, szA, szB, szC); }, 0, "incorrect information"},
         {[&] { return PF_CONF::IsRuleEnable(blAnswer, nullptr); }, 0, "pConf shall not be NULL"},
         {[&] { return PF_CONF::GetRuleID(szA, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::GetRuleProtocol(szA, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::GetRulePort(szA, szB, nullptr); }, 0, "pConf shall not be NULL"},
+        {[&] { return PF_CONF::GetRuleServiceName(szA, nullptr); }, 0, "pConf shall not be NULL"},
         {[&] { return PF_CONF::GetRuleServiceID(szA, nullptr); }, 0, "pConf shall not be NULL"},
         {[&] { return PF_CONF::ToArray(nNumber, nullptr, nullptr); }, 0, "pRgRules is NULL or *pRgRules is not NULL"},
         {[&] { return PF_CONF::FreeArray(nullptr); }, 0, "pConfHead is NULL"},
@@ -290,7 +293,8 @@ TEST_F(Library, WhatRunsIsToldByWhoIsAliveAndWhatIsMarked) {
 // Each call by itself, from the first allocation that fails on: it fails, and says so.
 TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
     const std::string szLong = "longer than a small string, so that it needs memory";
-    Write(kRouterConf, "[192.168.1.1]\nbrand=" + szLong + "\nmodel=M\nversion=1\n");
+    Write(kRouterConf, "[192.168.1.1]\nsupport_router_upnp=no\nsupport_router_natpmp=no\nbrand=" + szLong +
+                           "\nmodel=M\nversion=1\n");
     Write("/etc/portforward/router_upnp.db", "[" + szLong + "/M/1]\nsupport=yes\nmax=5\npfpath=" + szLong + "\n");
     Write(kRuleConf, "[" + szLong + "]\nenabled=1\ns_port=" + std::string(50, '1') +
                          "\nr_port=" + std::string(50, '2') + "\nprotocol name=" + szLong + "\nservice_id=" + szLong +
@@ -306,6 +310,9 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
         };
     };
     char szPorts[8] = {};
+    Write("/etc.defaults/portforward/routerdb/" + szLong + "/M/1/router.des",
+          "[global]\nsyntax version=3\n[PF port page]\nmax rule=7\nchange router port=yes\nsupport range=multi\n"
+          "[PF range page]\nmax rule=8\nchange router port=yes\n");
     const struct {
         const char* szWhat;
         std::function<int()> fnCall;
@@ -368,6 +375,28 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
         EXPECT_GT(nFailures, 0) << one.szWhat;
     }
     TAVOPFConfFree(pConf);
+    // Of these some can do without: what they say is true, or they say nothing.
+    int nNumber = 0;
+    bool blAnswer = false;
+    const std::tuple<std::function<bool()>, std::function<bool()>> rgAccessors[] = {
+        {[&] { return RouterDB("192.168.1.1").GetSyntaxVersion(nNumber); }, [&] { return nNumber == 3; }},
+        {[&] { return RouterDB("192.168.1.1").GetMaxPorts(nNumber); }, [&] { return nNumber == 7; }},
+        {[&] { return RouterDB("192.168.1.1").GetMaxRange(nNumber); }, [&] { return nNumber == 8; }},
+        {[&] { return RouterDB("192.168.1.1").IsSupportPageRange(blAnswer); }, [&] { return blAnswer; }},
+        {[&] { return upnp.GetMaxRule(nNumber); }, [&] { return nNumber == 5; }}};
+    for (const auto& [fnAsk, fnTrue] : rgAccessors) {
+        int nRefused = 0;
+        RunOutOfMemory([&, &fnAsk = fnAsk, &fnTrue = fnTrue](const auto& fnArm) {
+            nNumber = 0;
+            blAnswer = false;
+            fnArm();
+            const bool blTold = fnAsk();
+            gNGoodAllocations = -1;
+            EXPECT_TRUE(blTold ? fnTrue() : gBlAllocationFailed) << &fnAsk - &std::get<0>(rgAccessors[0]);
+            nRefused += blTold ? 0 : 1;
+        });
+        EXPECT_GT(nRefused, 0);
+    }
 }
 
 TEST_F(Library, ALockHeldElsewhereCostsNoDescriptors) {
@@ -466,10 +495,12 @@ TEST_F(Library, SettingsThatCannotBeGoneOnWithBeginAnew) {
         gLog.clear();
         fnArm();
         RouterConfWriter(true).Init();
+        RouterConfWriter(false).Init();
         gNGoodAllocations = -1;
         said.insert(gLog);
     });
     EXPECT_TRUE(said.contains({"hash malloc failed", szAnew}));
+    EXPECT_TRUE(said.contains({"hash malloc failed", "create a new section failed"}));
 }
 
 TEST_F(Library, RouterNames) {
@@ -550,7 +581,8 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         __tag_TAVO_ROUTER_DESC desc = {true};
         auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
         EXPECT_EQ(TLibGetRouterDesc(stored.szAddress, &desc, &enErr, true), stored.nDescribed) << stored.szStored;
-        EXPECT_EQ(Logged("get support change port failed"), szWords == "no no 0 0 0");
+        EXPECT_EQ(Logged("get support change port failed") && Logged("pRouterConf shall not be NULL"),
+                  szWords == "no no 0 0 0");
         EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);
         EXPECT_FALSE(desc.blSupportChangePort);
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));

@@ -36,7 +36,8 @@ protected:
             std::filesystem::remove_all(szDir);
             std::filesystem::create_directories(szDir);
         }
-        Write("/etc/portforward/router_upnp.db", "[B/M/1]\nmax=2\n[brand longer than a small string/M/1]\nmax=2\n");
+        Write("/etc/portforward/router_upnp.db",
+              "[B/M/1]\nmax=2\n[" + kLong + " brand/" + kLong + " model/" + kLong + " version]\nmax=2\n");
         Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", "[PF port page]\nmax rule=10\n");
         Reset();
     }
@@ -65,9 +66,11 @@ protected:
         gNSlept = 0;
         gLog.clear();
     }
-    static void Router(const std::string& szNatpmp, const std::string& szUpnp, const std::string& szBrand = "B") {
-        Write("/etc/portforward/router.conf", "[192.168.1.1]\nbrand=" + szBrand + "\nmodel=M\nversion=1\n" +
-                                                  "support_router_natpmp=" + szNatpmp +
+    static inline const std::string kLong = "longer than a small string:";
+    static void Router(const std::string& szNatpmp, const std::string& szUpnp, const std::string& szBrand = "B",
+                       const std::string& szModel = "M", const std::string& szVersion = "1") {
+        Write("/etc/portforward/router.conf", "[192.168.1.1]\nbrand=" + szBrand + "\nmodel=" + szModel +
+                                                  "\nversion=" + szVersion + "\nsupport_router_natpmp=" + szNatpmp +
                                                   "\nsupport_router_upnp=" + szUpnp + "\n");
     }
     static void Router(const std::string& szWay) {
@@ -348,8 +351,8 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
         RunOutOfMemory([&](const auto& fnArm) {
             Reset();
             const bool blManual = std::string(szWay) == "manual";
-            Router(szWay[0] == 'n' ? "yes" : "no", szWay[0] == 'u' ? "yes" : "no",
-                   blManual ? "B" : "brand longer than a small string");
+            Router(szWay[0] == 'n' ? "yes" : "no", szWay[0] == 'u' ? "yes" : "no", blManual ? "B" : kLong + " brand",
+                   blManual ? "M" : kLong + " model", blManual ? "1" : kLong + " version");
             Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
             Write("/var/tmp/natpmp_portmap.remap", "");
             fnArm();
@@ -363,8 +366,8 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
         });
     }
     for (const char* szLine :
-         {"fail to get brand", "get max rule fail", "add rule failed", "can not get max ports",
-          "sync rule to file fail", "failed to allocate list", "get router conf failed",
+         {"fail to get brand", "fail to get model", "fail to get version", "get max rule fail", "add rule failed",
+          "can not get max ports", "sync rule to file fail", "failed to allocate list", "get router conf failed",
 #ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
           "malloc fail: szRemap"
 #endif
