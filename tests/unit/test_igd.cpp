@@ -613,7 +613,8 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
         }
     }));
     EXPECT_EQ(mRgszTried.size(), 16U) << "one that names more is playing games";
-    EXPECT_EQ(gLog.size(), 8U) << "and the log is not filled";
+    EXPECT_EQ(gLog, std::vector<std::string>(8, "discovery answer refused: no positive answer")) << "and not more";
+    EXPECT_FALSE(tavo::SearchGateway(kGateway, "198.41.0.4", 30000, 0, {}, {})) << "that is no address of this box";
 }
 
 // Where nothing is heard it is over after two seconds and a half, else after three of silence.
@@ -690,8 +691,10 @@ TEST_F(SearchTest, TheGatewaysOwnAnnouncementsAreNews) {
     for (const bool blNews : {true, true, false}) {
         EXPECT_EQ(announcements.TakeNews(kGateway), blNews);
     }
+    gLog.clear();
     announcements.Listen("no address");
     EXPECT_EQ(announcements.Fd(), -1);
+    EXPECT_TRUE(LoggedFrom("router that restarts is noticed at the next check only: "));
 }
 
 TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {

@@ -288,6 +288,7 @@ TEST(SectionedFile, ASectionBegunAgainGoesOnAndNamesAreNeverCut) {
         EXPECT_EQ(Read("/etc/portforward/rule.conf"), szText);
     }
     EXPECT_TRUE(Logged("line 2: neither a section nor a key; the file is left alone and not used"));
+    EXPECT_TRUE(Logged("too many sections, or a name over 1023 bytes; the file is left alone and not used"));
     std::filesystem::remove("/etc/portforward/rule.conf");
     EXPECT_EQ(TAVOPFRuleGet(), nullptr);
     EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_NOT_FOUND);
