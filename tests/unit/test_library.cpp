@@ -1,6 +1,7 @@
 // The library over the real platform: stores, knowledge base, locks and the saving of rules.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 
@@ -399,8 +400,111 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
     }
 }
 
+long OpenDescriptors() {
+    return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {});
+}
+
+#ifndef __SANITIZE_ADDRESS__  // which sees that by itself
+// A daemon calls these for years.
+TEST_F(Library, WhatIsCalledAgainAndAgainCostsNoMemory) {
+    const std::string szConf =
+        "[10.0.0.1]\nbrand=x\n[192.168.1.1]\nbrand=B\nmodel=M\nversion=1\nmax=5\n"
+        "support_router_upnp=no\nsupport_router_natpmp=no\n";
+    MakeManual("[global]\nsyntax version=1\n[PF port page]\nmax rule=9\n");
+    Write(kTool, "#!/bin/sh\necho syntax version=1\n");
+    Write(kRouterConf, szConf);
+    Write(kRuleConf, "[1]\nenabled=1\ns_port=1\nr_port=2\nprotocol name=tcp\n[2]\nenabled=x\n");
+    Write("/etc/portforward/router_upnp.db", "[B/M/1]\nsupport=yes\nmax=5\n");
+    SetDetectManualCache("192.168.1.1", "B", "M", "1");
+    std::string szText;
+    int nNumber = 0;
+    bool blAnswer = false;
+    const std::pair<const char*, std::function<void()>> rgCalls[] = {
+        {"settings written",
+         [&] {
+             for (const bool blReload : {true, false}) {
+                 RouterConfWriter writer(blReload);
+                 writer.ReloadOldSection("192.168.1.1");
+                 writer.ReloadOldSection("10.9.9.9");
+                 writer.ReloadOldSection("192.168.1.1");
+                 writer.CreateNewSection("192.168.1.1");
+                 writer.CreateNewSection("192.168.1.1");
+                 writer.SetBrandModelVersion("B", "M", "1");
+             }
+         }},
+        {"settings read",
+         [&] {
+             for (const char* szAddress : {"192.168.1.1", "10.9.9.9"}) {
+                 RouterConfReader(szAddress).GetBrand(szText);
+                 RouterDB(szAddress).GetMaxPorts(nNumber);
+                 __tag_TAVO_ROUTER_CONF conf = {};
+                 TLibGetRouterConf(szAddress, &conf, nullptr, true);
+                 TLibSetRouterConf(szAddress, &conf, nullptr, true);
+             }
+             RouterConfReader reader;
+         }},
+        {"settings replaced",
+         [&] {
+             __tag_TAVO_ROUTER_CONF conf = {};
+             TLibGetRouterConf("192.168.1.1", &conf, nullptr, true);
+             snprintf(conf.szConnType, sizeof(conf.szConnType), "http");
+             snprintf(conf.szConnPort, sizeof(conf.szConnPort), "80");
+             EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, nullptr, true), 0);
+         }},
+        {"rules",
+         [&] {
+             RouterRuleConfReader reader(false);
+             reader.StartNextRule();
+             reader.GetRulesNumber(nNumber);
+             RouterRuleConfWriter writer;
+             writer.AddRule(7, true, "1", "2", "tcp", "", "w");
+             Rule* pRules = nullptr;
+             writer.ToArray(nNumber, &pRules);
+             TLibFreeRulesArr(pRules);
+             writer.Sync("/etc/portforward/other.conf");
+             TAVO_PF_CONF* pConf = TAVOPFRuleGet();
+             pRules = nullptr;
+             EXPECT_EQ(PF_CONF::ToArray(nNumber, &pRules, pConf), 0);
+             TAVOPFConfFree(pConf);
+         }},
+        {"the cache",
+         [&] {
+             DetectCacheReader reader("192.168.1.1");
+             reader.IsSectionExisted(blAnswer);
+             SetDetectManualCache("192.168.1.1", "B", "M", "1");
+         }},
+        {"what is known of models",
+         [&] {
+             RouterUpnpDB("B", "M", "1").GetSupport(szText);
+             RouterUpnpDBUserWriter writer("B/M/1");
+             EXPECT_TRUE(writer.SetMaxRule(5) && writer.SetSupport("yes") && writer.Sync());
+             __tag_TAVO_ROUTERDB_LIST* pModels = nullptr;
+             EXPECT_EQ(TLibGetRouterDBList(&pModels), 1);
+             TLibFreeRouterDBList(pModels);
+             IGetCurrSyntaxVersion();
+         }},
+        {"locks", [] { TLibTavoPortMapLock(), TLibTavoPortMapUnLock(); }},
+    };
+    for (const auto& [szWhat, fnCall] : rgCalls) {
+        size_t nUsed = 0;
+        long nOpen = 0;
+        for (int i = 0; i < 60; ++i) {
+            if (i == 10) {
+                nUsed = mallinfo2().uordblks;
+                nOpen = OpenDescriptors();
+            }
+            fnCall();
+            gLog.clear();
+        }
+        EXPECT_LT(mallinfo2().uordblks, nUsed + 2000) << szWhat;
+        EXPECT_EQ(OpenDescriptors(), nOpen) << szWhat;
+    }
+    std::filesystem::remove("/etc/portforward/router_upnp.db.user");
+}
+#endif
+
 TEST_F(Library, ALockHeldElsewhereCostsNoDescriptors) {
-    const auto fnOpen = [] { return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}); };
+    const auto fnOpen = &OpenDescriptors;
     int fd = -1;
     ASSERT_EQ(lock_file("/tmp/routerconf.lock", fd), 1);
     const auto nOpen = fnOpen();
