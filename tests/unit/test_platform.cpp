@@ -210,6 +210,9 @@ TEST(SectionedFile, AnyValueSurvivesAndOpensNothing) {
     struct stat status = {};
     stat(kPath, &status);
     EXPECT_EQ(status.st_mode & 0777U, 0600U);
+    EXPECT_EQ(tavo::FormatSections({{"a]", {{"k=", "\r\n\t\x01\x7f\"\\"}}}}),
+              "[a\\x5d]\nk\\x3d=\"\\r\\n\\t\\x01\\x7f\\\"\\\\\"\n\n")
+        << "as other programs read it";
 }
 
 TEST(SectionedFile, ReadsWhatPeopleWriteAndRefusesTheRest) {
