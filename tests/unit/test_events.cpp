@@ -308,6 +308,28 @@ TEST_F(EventsTest, SlowOnesHoldNobodyUp) {
     EXPECT_EQ(Answer(fd), kOk);
 }
 
+// No proxy, and nobody else where it is sent to.
+TEST(HttpClient, AsksWhomItIsToldAndNobodyElse) {
+    setenv("http_proxy", "http://127.0.0.1:1", 1);
+    WebServer other("");
+    const std::string szElsewhere = "http://127.0.0.1:" + std::to_string(other.Port()) + "/";
+    WebServer server("HTTP/1.1 302 Found\r\nLocation: " + szElsewhere + "\r\nContent-Length: 2\r\n\r\nno");
+    tavo::HttpClient client(500);
+    const tavo::HttpAnswer answer = client.Post({kRouter, server.Port(), "/c"}, {"SOAPAction: x"}, "body");
+    unsetenv("http_proxy");
+    EXPECT_EQ(answer.enEnd, HttpEnd::kAnswered);
+    EXPECT_EQ(std::to_string(answer.nCode) + answer.szBody, "302no");
+    for (const char* szPart : {"POST /c HTTP/1.1\r\n", "\r\nUser-Agent: Linux UPnP/1.1 tavo/1.0\r\n",
+                               "\r\nSOAPAction: x\r\n", "\r\nContent-Length: 4\r\n"}) {
+        EXPECT_NE(server.Request().find(szPart), std::string::npos) << szPart << server.Request();
+    }
+    client.Get({kRouter, other.Port(), "/first"});
+    EXPECT_TRUE(other.Request().starts_with("GET /first ")) << other.Request();
+    WebServer plain("HTTP/1.1 200 OK\r\nContent-Length: 0\r\n\r\n");
+    EXPECT_NE(client.Get({kRouter, plain.Port(), "/", true}).enEnd, HttpEnd::kAnswered) << "it speaks no TLS";
+    EXPECT_EQ(plain.Request().find("GET"), std::string::npos);
+}
+
 TEST(HttpClient, AsksByAnyMethodAndReadsTheHeaders) {
     WebServer server("HTTP/1.1 200 OK\r\nSID:  uuid:1 \r\nTimeout: Second-7\r\n\r\n");  // and no end of the body
     const auto start = std::chrono::steady_clock::now();

@@ -244,8 +244,11 @@ public:
                 "<root><device><service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:" + mSzVersion +
                     "</serviceType><controlURL>/c</controlURL></service></device></root>"};
     }
-    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string& szBody) override {
+    tavo::HttpAnswer Post(const tavo::HttpUrl& url, const std::vector<std::string>& rgszHeaders,
+                          const std::string& szBody) override {
         ++mNPosts;
+        mRgszHeaders = rgszHeaders;
+        mRgszHeaders.push_back(url.Text());
         mSzAsked = szBody;
         return mNFault == 0 ? Said(mSzAnswer) : Fault(mNFault);
     }
@@ -259,6 +262,7 @@ public:
     int mNFault = 0;
     std::string mSzVersion = "2";
     std::string mSzAnswer;
+    std::vector<std::string> mRgszHeaders;  // and the address
     std::string mSzAsked;
     int mNPosts = 0;
 };
@@ -276,6 +280,10 @@ TEST(Igd, WhatIsAskedIsXmlWhateverATextHolds) {
                                "</u:AddPortMapping></s:Body></s:Envelope>"}) {
         EXPECT_NE(pRouter->mSzAsked.find(szPart), std::string::npos) << szPart << " in " << pRouter->mSzAsked;
     }
+    EXPECT_EQ(pRouter->mRgszHeaders,
+              (std::vector<std::string>{"Content-Type: text/xml; charset=\"utf-8\"", "Expect:",
+                                        "SOAPAction: \"urn:schemas-upnp-org:service:WANIPConnection:2#AddPortMapping\"",
+                                        "http://192.168.1.1:80/c"}));
 }
 
 TEST(Igd, ARangeShowsWhatMakesSense) {
@@ -748,6 +756,11 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
     gSzGateway = "192.168.1.1";
     EXPECT_TRUE(tavo::RecallRouter(kGateway).place.szLocation.ends_with("/found")) << "what is found is kept";
     EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
+    std::filesystem::remove_all("/var/lib/tavo/upnp_igd.conf");
+    std::filesystem::create_directories("/var/lib/tavo/upnp_igd.conf");
+    tavo::KeepRouter(kGateway, {"http://192.168.77.1/", true});
+    EXPECT_TRUE(Logged("write /var/lib/tavo/upnp_igd.conf"));
+    std::filesystem::remove("/var/lib/tavo/upnp_igd.conf");
 }
 
 TEST(Notify, ALifeIsANumberOrAPlace) {
