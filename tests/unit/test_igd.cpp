@@ -493,6 +493,11 @@ TEST(Igd, WhatAnEntryAndAnAddressSay) {
         EXPECT_EQ(pIgd->ExternalAddress(szAddress), tavo::kWireGarbage);
         EXPECT_EQ(szAddress, "as it was");
     }
+    IgdEntry bounded;
+    pHttp->mSzAnswer = fnTag("NewInternalPort", "1") + fnTag("NewInternalClient", "192.168.1.5") +
+                       fnTag("NewPortMappingDescription", std::string(257, 'x').c_str());
+    EXPECT_EQ(pIgd->Get("UDP", 1, bounded), tavo::kWireOk);
+    EXPECT_EQ(bounded.szDescription, std::string(256, 'x'));
     pHttp->mSzAnswer = fnTag("NewExternalIPAddress", " 198.41.0.4 ");
     EXPECT_EQ(pIgd->ExternalAddress(szAddress), tavo::kWireOk);
     EXPECT_EQ(szAddress, "198.41.0.4");

@@ -289,6 +289,13 @@ TEST(GatewayAnnouncements, AreTheGatewaysOwn) {
     ASSERT_EQ(rgHeard.size(), 2U);
     EXPECT_EQ(std::pair(rgHeard[0].blPcp, rgHeard[0].nEpoch), std::pair(false, 7U));
     EXPECT_TRUE(announcements.Take(kGateway).empty());
+    const tavo::Descriptor fd = SocketAt(kGateway);
+    setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &loopback, sizeof(loopback));
+    for (int i = 0; i < 65; ++i) {
+        sendto(fd.Get(), rgStarted.data(), rgStarted.size(), 0, reinterpret_cast<const sockaddr*>(&all), sizeof(all));
+    }
+    EXPECT_EQ(announcements.Take(kGateway).size(), 64U) << "of a flood, so many at once";
+    EXPECT_EQ(announcements.Take(kGateway).size(), 1U);
 }
 
 TEST(NatpmpClient, AsksForWhatItIsToldTo) {
