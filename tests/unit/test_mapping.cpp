@@ -387,11 +387,12 @@ TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
         EXPECT_FALSE((core.record.Here().contains({"TCP", 30}))) << "what could not be made is nothing of ours";
         EXPECT_EQ((core.record.Here()[{"TCP", 10}].nMore), 1);
         if (row.blApplies && row.nTornAway == 0) {
+            router.Put(Range(Entry(60, 60, kBox, "game"), 0));
+            const std::vector<RouterMapping> rgKept = {Entry(20, 20, "", "tavo:c"), Entry(60, 60, "", "tavo:d")};
+            core.Run(router, rgKept);
             router.mNCalls = 0;
-            core.Run(router, {Entry(20, 20, "", "tavo:c")});
-            router.mNCalls = 0;
-            core.Run(router, {Entry(20, 20, "", "tavo:c")});
-            EXPECT_EQ(router.mNCalls, 2) << "the list, and one look once that is applied";
+            EXPECT_EQ(Texts(core.Run(router, rgKept)), (Rows{"20/tcp 1", "60/tcp 1 others"}));
+            EXPECT_EQ(router.mNCalls, 3) << "the list, and one look at each once that is applied";
         }
     }
 }
