@@ -53,6 +53,7 @@ struct TestClient {
     std::map<std::string, int> mapAnswers;
     std::map<std::string, std::string> mapWords;
     std::vector<std::string> rgszCalls;
+    std::vector<std::string> rgszReported;  // what a user is shown, as "step=word"
     int nTester = 0;
     std::vector<int> rgVerdicts;
     std::vector<std::string> rgszRouterLog;

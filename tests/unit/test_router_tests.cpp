@@ -86,6 +86,7 @@ int TAVOUpnpReportTestProgress(const char* szStep, const char* szValue, int nFla
         return Real("TAVOUpnpReportTestProgress", &TAVOUpnpReportTestProgress)(szStep, szValue, nFlags);
     }
     const OwnMemory own;
+    gPClient->rgszReported.push_back(std::string(szStep) + "=" + szValue);
     const auto it = gPClient->mapWords.find(szStep);
     if (it == gPClient->mapWords.end() || strcmp(szStep, "upnp_max") != 0 || strcmp(szValue, "processing") == 0) {
         Put(szStep, szValue);
@@ -181,15 +182,15 @@ TEST_F(RouterTests, EachStepThatFails) {
         {"no end", {{"end", -1}}, {}, 1, 20, 90, "TavoUpnpTestTerminate() failed"},
     };
     // What a user is shown of the steps that the library itself ends.
-    const std::map<std::string, std::pair<const char*, const char*>> mapShown = {
-        {"all pass", {"upnp_connection_success", "success"}},
-        {"add", {"upnp_add", "failed"}},
-        {"count", {"upnp_max", "-1"}},
-        {"delete", {"upnp_delete", "failed"}},
-        {"setup", {"upnp_connection_failed", "failed"}},
-        {"deleted ports stay open", {"upnp_connection_failed", "failed"}},
-        {"re-add", {"upnp_readd2", "failed"}},
-        {"ports stay closed", {"upnp_connection_success", "failed"}}};
+    const std::map<std::string, std::vector<std::string>> mapShown = {
+        {"all pass", {"upnp_terminal=processing", "upnp_terminal=finished"}},
+        {"add", {"upnp_add=failed"}},
+        {"count", {"upnp_max=-1"}},
+        {"delete", {"upnp_delete=failed"}},
+        {"setup", {"upnp_connection_failed=failed"}},
+        {"deleted ports stay open", {"upnp_connection_failed=failed"}},
+        {"re-add", {"upnp_readd1=failed", "upnp_readd2=failed"}},
+        {"ports stay closed", {"upnp_connection_success=failed"}}};
     const std::vector<int> rgOrder = {10, 20, 30, 60, 40, 50, 70, 80, 90};
     for (const bool blNamed : {true, false}) {
         for (const StepCase& step : rgCases) {
@@ -217,9 +218,9 @@ TEST_F(RouterTests, EachStepThatFails) {
             EXPECT_EQ(Logged("fillTestCompResult() failed"), !blNamed);
             EXPECT_EQ(Logged("brand & model & version shall not be all empty"), !blNamed);
             if (const auto shown = mapShown.find(step.szWhat); shown != mapShown.end()) {
-                char szWord[20] = {};
-                TLIBCFileGetKeyValue("/tmp/upnp_test.progress", shown->second.first, szWord, sizeof(szWord), 0);
-                EXPECT_STREQ(szWord, shown->second.second);
+                const auto& rgszReported = mClient.rgszReported;
+                const auto nLast = static_cast<std::ptrdiff_t>(shown->second.size());
+                EXPECT_EQ(std::vector<std::string>(rgszReported.end() - nLast, rgszReported.end()), shown->second);
             }
         }
     }
@@ -238,6 +239,12 @@ TEST_F(RouterTests, APassedTestInItsOrder) {
                      "=====re-add port test start=====", "=====test ports connection status(add) start=====",
                      "=====terminal daemon====="}));
     EXPECT_EQ(mClient.rgszCalls, (Lines{"add", "count", "delete", "setup", "closed", "modify", "open", "end"}));
+    EXPECT_EQ(
+        mClient.rgszReported,
+        (Lines{"upnp_init=processing", "upnp_add=processing", "upnp_init=success", "upnp_add=processing",
+               "upnp_max=processing", "upnp_max=10", "upnp_delete=processing", "upnp_connection_failed=processing",
+               "upnp_connection_failed=success", "upnp_readd1=processing", "upnp_connection_success=processing",
+               "upnp_connection_success=success", "upnp_terminal=processing", "upnp_terminal=finished"}));
     EXPECT_EQ(gNSlept, 7 * 4);  // seven steps are waited for
     EXPECT_EQ(gLog, Lines());
     // A step that is worked on is looked at each second, and an end is waited for.
