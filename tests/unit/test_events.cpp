@@ -316,11 +316,10 @@ TEST_F(EventsTest, SlowOnesHoldNobodyUp) {
 // No proxy, and nobody else where it is sent to.
 TEST(HttpClient, AsksWhomItIsToldAndNobodyElse) {
     setenv("http_proxy", "http://127.0.0.1:1", 1);
-    WebServer other("");
+    WebServer other("HTTP/1.1 200 OK\r\nContent-Length: 0\r\n\r\n");
     const std::string szElsewhere = "http://127.0.0.1:" + std::to_string(other.Port()) + "/";
     WebServer server("HTTP/1.1 302 Found\r\nLocation: " + szElsewhere + "\r\nContent-Length: 2\r\n\r\nno");
-    tavo::HttpClient client(500);
-    const tavo::HttpAnswer answer = client.Post({kRouter, server.Port(), "/c"}, {"SOAPAction: x"}, "body");
+    const tavo::HttpAnswer answer = tavo::HttpClient().Post({kRouter, server.Port(), "/c"}, {"SOAPAction: x"}, "body");
     unsetenv("http_proxy");
     EXPECT_EQ(answer.enEnd, HttpEnd::kAnswered);
     EXPECT_EQ(std::to_string(answer.nCode) + answer.szBody, "302no");
@@ -328,10 +327,11 @@ TEST(HttpClient, AsksWhomItIsToldAndNobodyElse) {
                                "\r\nSOAPAction: x\r\n", "\r\nContent-Length: 4\r\n"}) {
         EXPECT_NE(server.Request().find(szPart), std::string::npos) << szPart << server.Request();
     }
-    client.Get({kRouter, other.Port(), "/first"});
+    tavo::HttpClient().Get({kRouter, other.Port(), "/first"});
     EXPECT_TRUE(other.Request().starts_with("GET /first ")) << other.Request();
     WebServer plain("HTTP/1.1 200 OK\r\nContent-Length: 0\r\n\r\n");
-    EXPECT_NE(client.Get({kRouter, plain.Port(), "/", true}).enEnd, HttpEnd::kAnswered) << "it speaks no TLS";
+    EXPECT_NE(tavo::HttpClient(300).Get({kRouter, plain.Port(), "/", true}).enEnd, HttpEnd::kAnswered)
+        << "it speaks no TLS";
     EXPECT_EQ(plain.Request().find("GET"), std::string::npos);
 }
 
@@ -529,7 +529,7 @@ TEST(BoundedSocket, AnAnswerIsWholeOrGivenUp) {
         tavo::BoundedSocket bounded(fdHere.Get(), fdStop.Get());
         bounded.Write(szAnswer);
         bounded.Finish();
-        EXPECT_LT(std::chrono::steady_clock::now() - start, 900ms);
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 3s);
         reader.join();
         EXPECT_EQ(nRead, blReads ? szAnswer.size() : 0);
         char cRest = 0;
