@@ -256,9 +256,25 @@ TEST_F(RouterTests, APassedTestInItsOrder) {
     };
     gNSlept = 0;
     EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), 0);
+    EXPECT_EQ(gNSlept, 7 * 4 + 4);
+    // And one whose word is lost, whenever that is, is not done.
+    for (const int nLost : {0, 1, 2}) {
+        int nSleeps = 0;
+        gFnOnSleep = [&] {
+            if (nSleeps == nLost) {
+                std::filesystem::remove(kProgress);
+            } else if (nSleeps == 1) {
+                TLIBCFileSetKeyValue(kProgress, "upnp_add", "finished", nullptr);
+            }
+            ++nSleeps;
+        };
+        gLog.clear();
+        EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), 1) << nLost;
+        EXPECT_EQ(gLog, (Lines{"TLIBCFileGetKeyValue() failed", "TavoUpnpTestWaitMessage(upnp_add) failed"}));
+        EXPECT_EQ(nSleeps, nLost + 1);
+    }
     gFnOnSleep = nullptr;
     mClient.mapWords.erase("upnp_add");
-    EXPECT_EQ(gNSlept, 7 * 4 + 4);
     for (const TAVO_UPNP_GATEWAY_MODEL& model :
          {TAVO_UPNP_GATEWAY_MODEL{"A", "", ""}, TAVO_UPNP_GATEWAY_MODEL{"", "B", ""},
           TAVO_UPNP_GATEWAY_MODEL{"", "", "C"}}) {
