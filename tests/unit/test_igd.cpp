@@ -585,8 +585,13 @@ protected:
 TEST_F(SearchTest, AsksForEachKindAgainAndAgainUntilItsLimit) {
     for (const auto& [nMilliseconds, nQuestions, nKinds] : {std::tuple(100, 4U, 4U), {280, 8U, 4U}, {900, 17U, 9U}}) {
         mRgszTargets.clear();
+        int nTurns = 0;
         const auto start = std::chrono::steady_clock::now();
-        EXPECT_FALSE(Search(nMilliseconds, [this] { Hear(); }));
+        EXPECT_FALSE(Search(nMilliseconds, [&] {
+            Hear();
+            ++nTurns;
+        }));
+        EXPECT_GE(nTurns, nMilliseconds == 1100 ? 7 : 1) << "a stop is looked for in between";
         const auto took = std::chrono::steady_clock::now() - start;
         EXPECT_TRUE(took >= nMilliseconds * 1ms && took < nMilliseconds * 1ms + 2s) << took / 1ms;
         EXPECT_EQ(mRgszTargets.size(), nQuestions) << nMilliseconds;
