@@ -810,7 +810,7 @@ TEST(Notify, EachDeviceOfARouterHasALifeOfItsOwn) {
         EXPECT_EQ(many.IsNews(fnMessage("0", "x")), nDevices == 65);
         EXPECT_FALSE(many.IsNews(fnMessage(std::to_string(nDevices - 1), "x")));
     }
-    for (const size_t nSame : {255, 256}) {  // two that differ behind a life's bound are one
+    for (const size_t nSame : {size_t{255}, size_t{256}}) {  // two that differ behind a life's bound are one
         const std::string szLife(nSame, 'x');
         lives.IsNews(fnMessage("igd", szLife + "a"));
         EXPECT_EQ(lives.IsNews(fnMessage("igd", szLife + "b")), nSame == 255) << nSame;

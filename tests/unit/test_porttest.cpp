@@ -181,7 +181,7 @@ TEST(Prober, SaysOfEachPortWhatCameBack) {
             own.sin_family = AF_INET;
             own.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
             socklen_t nLength = sizeof(own);
-            bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength);
+            EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength), 0);
             listen(fd.Get(), 1);
             getsockname(fd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength);
             nPort = ntohs(own.sin_port);
