@@ -768,7 +768,7 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
     EXPECT_TRUE(tavo::RecallRouter(kGateway).blPermanentOnly);
     std::filesystem::remove_all("/var/lib/tavo/upnp_igd.conf");
     std::filesystem::create_directories("/var/lib/tavo/upnp_igd.conf");
-    tavo::KeepRouter(kGateway, {"http://192.168.77.1/", true});
+    tavo::KeepRouter(kGateway, {{"http://192.168.77.1/", ""}, "aa"});
     EXPECT_TRUE(Logged("write /var/lib/tavo/upnp_igd.conf"));
     std::filesystem::remove("/var/lib/tavo/upnp_igd.conf");
 }
