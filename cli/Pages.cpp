@@ -9,6 +9,7 @@
 #include <ctime>
 #include <filesystem>
 
+#include "Box.h"
 #include "Child.h"
 #include "Usage.h"
 
@@ -17,12 +18,20 @@ namespace tavo::cli {
 namespace {
 
 constexpr char kProgram[] = "/usr/tavo/bin/tavoportforward";
+// Its other name, for what only reads: whoever asks what runs takes a process of the first one for a save.
+constexpr char kReader[] = "/usr/tavo/bin/tavopages";
 constexpr char kName[] = "tavoportforward";
 // The second one is of an earlier version, and taken over by the program.
 constexpr const char* kRecords[] = {"/var/lib/tavo/pages_made.conf", "/var/lib/tavo/manual_router.made"};
 constexpr auto kLook = std::chrono::seconds(5);
 constexpr auto kTakeAway = std::chrono::seconds(200);  // a run ends by itself before
 constexpr size_t kMostBytes = 32 << 20;
+
+// In the place of what nobody can tell now.
+PublishedLeftOver Untold() {
+    return {"what their record has", "",
+            fmt::format("{} did not say what that is; is it there, and can it be run?", kReader), std::nullopt};
+}
 
 }  // namespace
 
@@ -37,26 +46,40 @@ bool HavePagesMade() {
     return false;
 }
 
+std::optional<Published> PagesWord(bool blInUse) {
+    auto published = ReadPublished(kName);
+    const auto szGateway = Gateway();
+    const bool blCounts = published && szGateway && published->szGateway == *szGateway;
+    return blCounts && published->blSwitchedOn == blInUse ? std::move(published) : std::nullopt;
+}
+
 std::optional<Published> LeftByPages() {
     if (geteuid() != 0) {
-        auto published = ReadPublished(kName);
-        return published && !published->blSwitchedOn ? std::move(published) : std::nullopt;
+        return PagesWord(false);
     }
-    return HavePagesMade() ? PublishedIn(OutputOf({kProgram, "--left"}, kLook, kMostBytes)) : std::nullopt;
+    if (!HavePagesMade()) {
+        return std::nullopt;
+    }
+    auto left = PublishedIn(OutputOf({kReader, "--left"}, kLook, kMostBytes));
+    if (!left) {
+        left.emplace().rgLeftOver = {Untold()};
+    }
+    return left;
 }
 
 std::vector<PublishedLeftOver> TakeAwayByPages() {
     const time_t nStart = std::time(nullptr);
     OutputOf({kProgram, "--take-away"}, kTakeAway, kMostBytes);
-    auto left = LeftByPages();
-    const auto published = ReadPublished(kName);
-    if (published && !published->blSwitchedOn && published->nAt >= nStart) {  // else that run did not come to its end
-        left = published;
+    auto left = PagesWord(false);
+    const bool blEnded = left && left->nAt >= nStart;
+    if (!blEnded) {
+        left = LeftByPages();
     }
-    if (!left && HavePagesMade()) {
-        return {{"what their record has", "", fmt::format("{} did not say what that is", kProgram), std::nullopt}};
+    auto rgLeft = left ? std::move(left->rgLeftOver) : std::vector<PublishedLeftOver>();
+    for (PublishedLeftOver& row : rgLeft) {
+        row.szWhy = blEnded ? row.szWhy : fmt::format("{} could not be run, or did not come to its end", kProgram);
     }
-    return left ? left->rgLeftOver : std::vector<PublishedLeftOver>();
+    return rgLeft;
 }
 
 std::string NamesOf(const std::vector<PublishedLeftOver>& rgLeft) {

@@ -15,8 +15,11 @@ namespace tavo::cli {
 
 // Whether something is on record, of whatever router; false for a user who may not look.
 bool HavePagesMade();
-// What is on record of the router in front, without asking it. A user who may not read the record learns what the last
-// attempt to take it away has left; nothing where there was none.
+// What the last run of the program came to at the router in front: one that wrote the rules (blInUse), or one that took
+// away what it made. Nothing where that was another one, or of another router.
+std::optional<Published> PagesWord(bool blInUse);
+// What is on record of the router in front, without asking it; where nobody can say it, that. A user who may not read
+// the record learns what the last attempt to take it away has left; nothing where there was none.
 std::optional<Published> LeftByPages();
 // Has the pages take it away. What they still forward then, each with the reason.
 std::vector<PublishedLeftOver> TakeAwayByPages();

@@ -178,10 +178,7 @@ Situation LookAround(bool blLive) {
     situation.detected = ReadDetected();
     LookAt(situation.upnpd, "runupnpportmapping", UpnpDaemon().IsAlive());
     LookAt(situation.natpmpd, "runnatpmpportmapping", NatpmpDaemon().IsAlive());
-    situation.pages = ReadPublished("tavoportforward");
-    if (situation.pages && !situation.pages->blSwitchedOn) {
-        situation.pages.reset();
-    }
+    situation.pages = PagesWord(true);
     if (!situation.IsByPages()) {
         situation.pagesLeft = LeftByPages();
     }

@@ -1164,16 +1164,19 @@ class Tool(unittest.TestCase):
         self.expect("status", OK, "all 2 rules are in force, as the router's pages took them at")
         self.expect("status --live", OK, "warning: what stands in a router's own pages is not read back")
         self.expect("router table", FAILED, "its table stands there, mostly at http://192.168.77.1/")
+        self.publish(1, name="tavoportforward", protocol="pages", gateway="10.9.9.9")
+        self.assertEqual(self.standing()[:2], (FAILED, "unknown"), "what another router took")
 
     def test_what_pages_forward_that_are_not_in_use_is_named(self):
         """By the program that keeps the record; where it knows no account any more it asks nobody."""
-        program, record = "/usr/tavo/bin/tavoportforward", "/var/lib/tavo/pages_made.conf"
+        program, reader, record = "/usr/tavo/bin/tavoportforward", "/usr/tavo/bin/tavopages", "/var/lib/tavo/pages_made.conf"
         row = '[{0} {2} {3}]\ngateway="{0}"\nhardware="{1}"\nprotocol="{2}"\nrouter_port="{3}"\nbox_port="{3}"\nmore="{4}"\nclient="192.168.77.2"\ntext="tavo:x"\nshown="no"\n'
         os.makedirs("/usr/tavo/bin", exist_ok=True)
-        with contextlib.suppress(FileNotFoundError):
-            os.unlink(program)
-        os.symlink(f"{BUILD}/programs/tavoportforward", program)
-        self.addCleanup(lambda: [os.path.lexists(path) and os.unlink(path) for path in (program, record, "/run/tavo/tavoportforward.json")])
+        remove = lambda *paths: [os.path.lexists(path) and os.unlink(path) for path in paths]
+        remove(program, reader)
+        for path in (program, reader):
+            os.symlink(f"{BUILD}/programs/tavoportforward", path)
+        self.addCleanup(remove, program, reader, record, "/run/tavo/tavoportforward.json")
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
         why = "own pages forward it: take it away there \\(there are no settings for the pages of the router 192.168.77.1\\)"
         for text, names in ((row.format(GATEWAY, "", "TCP", 443, 0) + row.format(GATEWAY, "", "BOTH", 7000, 4), ["7000-7004/both", "443/tcp"]),
@@ -1197,15 +1200,21 @@ class Tool(unittest.TestCase):
                 self.assertEqual("pages, which are not in use any more, still forward 7000-7004/both, 443/tcp" in told["message"], bool(names))
         self.assertEqual(self.in_force()[0]["enabled"], False)
         put(record, row.format(GATEWAY, "", "TCP", 443, 0))
-        for script, named in (("exit 1", ["what their record has"]),  # and an older run's word does not count
-                              (f'[ "$1" = --left ] && exec {BUILD}/programs/tavoportforward --left; exit 1', ["443/tcp"])):
-            os.unlink(program)
-            put(program, f"#!/bin/sh\n{script}\n")
-            os.chmod(program, 0o755)
+        remove(program)
+        untold, named = ["what their record has"], ["443/tcp"]
+        for script, mode, said in (("exit 1", 0o755, untold), (None, 0, untold), ("", 0o644, untold),  # an older run's word does not count
+                                   (f"cat /proc/$$/comm /proc/$$/cmdline >/tmp/seen; exec {BUILD}/programs/tavoportforward $1", 0o755, named)):
+            remove(reader)
+            if script is not None:
+                put(reader, f"#!/bin/sh\n{script}\n")
+                os.chmod(reader, mode)
             self.keep(alive=False)
             self.publish(1, name="tavoportforward", protocol="pages", left_over=[], switched_on=False, at=1000)
-            code, told = self.json("off", **WRITES)
-            self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (REFUSED, named), told)
+            for command, wanted in (("off", REFUSED), ("status", OK)):
+                code, told = self.json(command, **WRITES)
+                self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (wanted, said), told)
+        self.assertNotIn("tavoportforward", get("/tmp/seen"), "nobody who asks what runs takes it for a save")
+        self.assertIn("tavoportforward could not be run", self.json("off", **WRITES)[1]["message"])
 
     def test_status_takes_nobodys_word_but_roots(self):
         path = "/run/tavo/upnpd.json"

@@ -156,7 +156,7 @@ class Lab:
                           "/usr/tavo/bin", "/etc/tavo"):
             os.makedirs(directory, exist_ok=True)
         for program in (*(f"sbin/{daemon}" for daemon in DAEMONS), "sbin/tavoairportd", "bin/tavoportforward",
-                        "bin/tavohook"):
+                        "bin/tavopages", "bin/tavohook"):
             if os.path.lexists(f"/usr/tavo/{program}"):
                 os.unlink(f"/usr/tavo/{program}")
             os.symlink(f"{BUILD}/programs/{os.path.basename(program)}", f"/usr/tavo/{program}")
