@@ -9,8 +9,10 @@
 #include "Box.h"
 #include "Commands.h"
 #include "OpenPort.h"
+#include "Pages.h"
 #include "PortNames.h"
 #include "SaveRules.h"
+#include "StoredRouter.h"
 #include "Usage.h"
 
 namespace tavo::cli {
@@ -24,9 +26,10 @@ constexpr char kUnnoted[] =
 constexpr char kOffAlready[] = "every port is switched off already; 'sudo tavoportmap on' opens them again";
 
 // Has fnChange change the rules in force and saves them. fnChange answers what there is to say when nothing is to be
-// saved; fnDone completes the reply to a save whose rules are in rule.conf.
+// saved; fnDone completes the reply to a save whose rules are in rule.conf; fnUnreadable does what can be done of rules
+// that cannot be read.
 Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnChange,
-             const std::function<void(Reply&)>& fnDone) {
+             const std::function<void(Reply&)>& fnDone, const std::function<Reply()>& fnUnreadable = Unreadable) {
     if (const auto reply = NeedsRoot()) {
         return *reply;
     }
@@ -36,7 +39,7 @@ Reply Change(bool blJson, const std::function<std::optional<Reply>(Rules&)>& fnC
     }
     auto rules = LoadRules();
     if (!rules) {
-        return Unreadable();
+        return fnUnreadable();
     }
     if (const auto reply = fnChange(*rules)) {
         return *reply;
@@ -285,6 +288,24 @@ Reply ClosePorts(const std::vector<std::string>& rgszWords, bool blJson) {
 
 // ---- off, on -----------------------------------------------------------------------------------------------
 
+// What the router's own pages forward that are not in use any more goes by their record, whatever the rules are.
+Reply OffUnread() {
+    Reply reply = Unreadable();
+    const StoredRouter router = ReadStoredRouter();
+    const auto before = router.blAny && router.enWay == Way::kManual ? std::nullopt : LeftByPages();
+    if (before && !before->rgLeftOver.empty()) {
+        const auto rgLeft = TakeAwayByPages();
+        if (rgLeft.empty()) {
+            reply.szMessage += fmt::format(
+                "\nThe router's own pages, which are not in use any more, have taken away what they still forwarded: "
+                "{}",
+                NamesOf(before->rgLeftOver));
+        }
+        AddLeftByPages(rgLeft, {}, reply);
+    }
+    return reply;
+}
+
 // Said once more it tells the router again, which may not have heard it.
 Reply Off(bool blJson) {
     bool blNoted = false;
@@ -310,7 +331,7 @@ Reply Off(bool blJson) {
         return std::nullopt;
     };
     bool blStored = false;
-    Reply reply = Change(blJson, fnChange, [&](Reply& done) {
+    const auto fnDone = [&](Reply& done) {
         blStored = true;
         if (done.enExit == kOk) {
             done.szMessage = blAlready
@@ -323,7 +344,8 @@ Reply Off(bool blJson) {
                 "again\n" +
                 done.szMessage;
         }
-    });
+    };
+    Reply reply = Change(blJson, fnChange, fnDone, OffUnread);
     if (blNoted && !blStored) {
         DropOff();
     }

@@ -392,7 +392,7 @@ Exit Judgement::ExitCode() const {
         case Standing::kUntold:
             return kFailed;
         default:
-            return kOk;
+            return nLeftOver > 0 ? kRefused : kOk;
     }
 }
 
@@ -415,6 +415,14 @@ Judgement Judge(const Situation& situation) {
     outcome = outcome ? outcome : JudgeSurroundings(situation);
     std::tie(judgement.enStanding, judgement.szMessage) =
         outcome ? *outcome : JudgeRules(situation, judgement.rgRules, nWanted);
+    const bool blAsAsked = judgement.ExitCode() == kOk;
+    judgement.nLeftOver = situation.LeftOver().size();
+    if (blAsAsked && judgement.nLeftOver > 0) {
+        judgement.szMessage += fmt::format(
+            "; but the router may still have what no rule asks for: {} under 'left over on the "
+            "router'",
+            Count(judgement.nLeftOver, "row"));
+    }
     return judgement;
 }
 

@@ -44,6 +44,7 @@ struct Judgement {
     std::vector<RuleFact> rgRules = {};
     std::vector<LiveEntry> rgOthers = {};  // of other programs of this box, as the router's table shows them now
     std::vector<std::string> rgszWarnings = {};
+    size_t nLeftOver = 0;  // of what no rule asks for and the router still has
 
     Exit ExitCode() const;
 };

@@ -109,7 +109,7 @@ void AddLeftByPages(const std::vector<PublishedLeftOver>& rgLeft, const Rules& r
         "{}the router's own pages, which are not in use any more, still forward {} and did not take that away: {}\n"
         "'sudo tavoportmap {}' tries again; or take it away there by hand, and then call\n"
         "'sudo /usr/tavo/bin/tavoportforward --forget'",
-        szBefore, NamesOf(rgLeft), Clean(rgLeft.front().szWhy), IsOff() ? "off" : "save");
+        szBefore, NamesOf(rgLeft), Clean(rgLeft.front().szWhy), IsOff() || !LoadRules() ? "off" : "save");
 }
 
 }  // namespace tavo::cli

@@ -212,8 +212,8 @@ void OfferStatus(CLI::App& app, Request& request) {
     pStatus->add_flag("--watch", pWish->blWatch, "go on and tell what changes; Ctrl-C ends it");
     pStatus->footer(
         "Exit code: 0 everything that was asked for is in force (or nothing is asked for, or it is switched off); 4 "
-        "some "
-        "rule is not; 6 nothing is kept: router, network or daemon is away; 1 it cannot be told.\n");
+        "some rule is not, or the router still has what no rule asks for; 6 nothing is kept: router, network or daemon "
+        "is away; 1 it cannot be told.\n");
     pStatus->callback(
         [pWish, &request] { request.fnCommand = [pWish, &request] { return Status(*pWish, request.blJson); }; });
 }

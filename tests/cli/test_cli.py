@@ -1187,8 +1187,10 @@ class Tool(unittest.TestCase):
                 put(record, text)
                 put(ROUTER, settings)
                 self.publish(1, name="tavoportforward", protocol="pages", left_over=[])
-                self.assertEqual([left["name"] for left in self.json("status")[1]["left_over"]], said)
+                code, told = self.json("status")
+                self.assertEqual([left["name"] for left in told["left_over"]], said)
                 if said:
+                    self.assertNotEqual(code, OK)
                     self.assertRegex(tool("status")[1], f"443/tcp +192.168.77.2 +.*{why}")
                     self.assertEqual(get(record), text, "to look changes nothing")
             for command, done in (("close web", "443/tcp closed"), ("off", "every port is closed")):
@@ -1198,6 +1200,9 @@ class Tool(unittest.TestCase):
                 self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (REFUSED if names else OK, names), told)
                 self.assertEqual(done in told["message"], not names, told)
                 self.assertEqual("pages, which are not in use any more, still forward 7000-7004/both, 443/tcp" in told["message"], bool(names))
+            code, told = self.json("status")
+            self.assertEqual((code, "no rule asks for: 2 rows" in told["message"]),
+                             (REFUSED, True) if names else (OK, False), "what 'off' did not close is no success")
         self.assertEqual(self.in_force()[0]["enabled"], False)
         put(record, row.format(GATEWAY, "", "TCP", 443, 0))
         remove(program)
@@ -1210,11 +1215,15 @@ class Tool(unittest.TestCase):
                 os.chmod(reader, mode)
             self.keep(alive=False)
             self.publish(1, name="tavoportforward", protocol="pages", left_over=[], switched_on=False, at=1000)
-            for command, wanted in (("off", REFUSED), ("status", OK)):
+            for command in ("off", "status"):
                 code, told = self.json(command, **WRITES)
-                self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (wanted, said), told)
+                self.assertEqual((code, [left["name"] for left in told.get("left_over", [])]), (REFUSED, said), told)
         self.assertNotIn("tavoportforward", get("/tmp/seen"), "nobody who asks what runs takes it for a save")
         self.assertIn("tavoportforward could not be run", self.json("off", **WRITES)[1]["message"])
+        put(RULES, "no rules\n")
+        code, told = self.json("off", **WRITES)
+        self.assertEqual((code, [left["name"] for left in told["left_over"]]), (FAILED, named), told)
+        self.assertRegex(told["message"], "cannot be read(?s:.)*still forward 443/tcp(?s:.)*'sudo tavoportmap off' tries again")
 
     def test_status_takes_nobodys_word_but_roots(self):
         path = "/run/tavo/upnpd.json"
