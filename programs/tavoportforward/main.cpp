@@ -13,6 +13,7 @@
 #include <cstdio>
 #include <cstring>
 #include <exception>
+#include <iterator>
 #include <memory>
 
 #include "ground/BootClock.h"
@@ -56,6 +57,10 @@ constexpr char kHelp[] =
 constexpr char kMadeFile[] = "/var/lib/tavo/pages_made.conf";
 // The settings of the pages while UPnP or NAT-PMP drives the router.
 constexpr char kAside[] = "/etc/portforward/router_account.conf";
+// How pages that are not in use get an account with a description again.
+constexpr char kNameThem[] =
+    "; 'sudo tavoportmap router set' with --upnp no and the --brand, --model and --version of their description says "
+    "which they are, and with --upnp yes goes back";
 constexpr char kLock[] = "/var/run/tavoportforward.lock";
 constexpr auto kRunLimit = std::chrono::seconds(180);  // well below the five minutes that a save waits
 constexpr int kAddressSize = 64;
@@ -149,28 +154,57 @@ const TAVO_PF_CONF* SectionOf(const TAVO_PF_CONF* pSection, const std::string& s
     return pSection;
 }
 
-// Whether these settings have the router driven through its pages.
-bool IsInUse(const TAVO_PF_CONF* pSection) {
+// Whether these settings say where the pages are.
+bool HasPages(const TAVO_PF_CONF* pSection) {
     return pSection != nullptr && !Value(pSection, "conn_type").empty();
 }
 
-// blAside: where the settings are not those of the pages, what was put aside will do.
+// Whether they have the router driven through them.
+bool IsInUse(const TAVO_PF_CONF* pSection) {
+    return HasPages(pSection) && Value(pSection, "support_router_upnp") != "yes" &&
+           Value(pSection, "support_router_natpmp") != "yes";
+}
+
+constexpr const char* kIdentity[] = {"brand", "model", "version"};
+
+bool IsNameless(const TAVO_PF_CONF* pSection) {
+    return std::all_of(std::begin(kIdentity), std::end(kIdentity),
+                       [&](const char* szKey) { return Value(pSection, szKey).empty(); });
+}
+
+// An earlier version put the account aside and not whose it is: it may be the one that the settings name now.
+ConfList LoadAside(const TAVO_PF_CONF* pNow, const std::string& szGateway) {
+    ConfList pAside = tavo::LoadConfList(kAside);
+    const TAVO_PF_CONF* pSection = SectionOf(pAside.get(), szGateway);
+    if (pNow != nullptr && pSection != nullptr && pSection->pHash != nullptr && IsNameless(pSection)) {
+        for (const char* szKey : kIdentity) {
+            TLIBCSzHashSetValue(pSection->pHash, szKey, Value(pNow, szKey).c_str());
+        }
+    }
+    return pAside;
+}
+
+// blAside: where the settings do not know the pages, what was put aside will do.
 bool Load(KnownRouter& router, bool blAside, std::string& szWhy) {
     if (!FindAddresses(router, szWhy)) {
         return false;
     }
     ConfList pRouters(TAVOPFGwRouterConfGet());
     const TAVO_PF_CONF* pSection = SectionOf(pRouters.get(), router.szGateway);
-    if (blAside && !IsInUse(pSection)) {
-        pRouters = tavo::LoadConfList(kAside);
+    if (blAside && !HasPages(pSection)) {
+        pRouters = LoadAside(pSection, router.szGateway);
         pSection = SectionOf(pRouters.get(), router.szGateway);
     }
     if (pSection == nullptr) {
         szWhy = "there are no settings for the " + std::string(blAside ? "pages of the router " : "router ") +
-                router.szGateway;
+                router.szGateway + (blAside ? kNameThem : "");
         return false;
     }
-    return LoadOperations(router, pSection, szWhy) && ReadSettings(router, pSection, szWhy);
+    if (!LoadOperations(router, pSection, szWhy)) {
+        szWhy += blAside && !router.pDescription ? kNameThem : "";
+        return false;
+    }
+    return ReadSettings(router, pSection, szWhy);
 }
 
 tavo::RouterState StateAfter(tavo::WebEnd enTrouble) {

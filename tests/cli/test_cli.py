@@ -1178,7 +1178,7 @@ class Tool(unittest.TestCase):
             os.symlink(f"{BUILD}/programs/tavoportforward", path)
         self.addCleanup(remove, program, reader, record, "/run/tavo/tavoportforward.json")
         put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
-        why = "own pages forward it: take it away there \\(there are no settings for the pages of the router 192.168.77.1\\)"
+        why = "own pages forward it: take it away there \\(there are no settings for the pages of the router 192.168.77.1; .*upnp yes goes back\\)"
         for text, names in ((row.format(GATEWAY, "", "TCP", 443, 0) + row.format(GATEWAY, "", "BOTH", 7000, 4), ["7000-7004/both", "443/tcp"]),
                             (row.format("10.9.9.9", "", "TCP", 443, 0), []), ("", []), ("no record\n", [])):
             for on, settings, said in (("upnp", KNOWN % ("yes", "no"), names), ("natpmp", KNOWN % ("no", "yes"), names),

@@ -12,6 +12,8 @@ LAB = None
 TOOL = "/usr/tavo/bin/tavoportforward"
 EVENTS = "/var/log/tavo/event.log"
 RECORD, EARLIER = "/var/lib/tavo/pages_made.conf", "/var/lib/tavo/manual_router.made"
+ACCOUNT = "/etc/portforward/router_account.conf"
+COBBLER, LAB_ONE = "--brand Cobbler --model Gate --version 7.3", "--brand Lab --model One --version 1"
 FOREIGN = {("tcp", 9999): (LAN2, 9999)}
 
 
@@ -20,6 +22,8 @@ def events():
 
 
 class Manual(unittest.TestCase):
+    web = None
+
     def setUp(self):
         LAB.install()
         self.forget()
@@ -216,101 +220,98 @@ class Manual(unittest.TestCase):
         tool.wait()
         self.saved({})
 
+    # ---- the settings go over to another way ------------------------------------------------------------------
+
+    def told(self, code, arguments):
+        run = LAB.run("box", f"{BUILD}/cli/tavoportmap --json {arguments}", check=False)
+        self.assertEqual(run.returncode, code, run.stdout)
+        return json.loads(run.stdout)
+
+    @staticmethod
+    def names(answer):
+        return [row["name"] for row in answer.get("left_over", [])]
+
+    @staticmethod
+    def forwarded():
+        return [f"{row['first']}/{row['protocol']}" for row in LAB.web_state()["table"] if row["host"] == BOX]
+
+    def clear(self):
+        if self.web is None:
+            return
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.clear_state(ACCOUNT, "/run/tavo/tavoportforward.json")
+        LAB.stop_router()
+        LAB.end(self.web)
+        self.web = None
+
+    def go_over(self, *rules, flavour="blind", settings=LAB_ONE):
+        """The pages have these rules, and somebody has switched the router's UPnP on. What "router set" says of it."""
+        self.clear()
+        LAB.install()
+        self.forget()
+        LAB.start_web(flavour)
+        self.web = LAB.router
+        self.addCleanup(self.clear)
+        LAB.save(*rules)
+        self.made = LAB.read(RECORD)
+        LAB.start_router()
+        return self.told(0, f"router set {settings} --upnp yes")
+
     def test_what_the_pages_forward_goes_when_they_are_not_in_use_any_more(self):
-        account = "/etc/portforward/router_account.conf"
-        pages = "router set --brand Cobbler --model Gate --version 7.3 --upnp no"
-
-        def told(code, arguments):
-            run = LAB.run("box", f"{BUILD}/cli/tavoportmap --json {arguments}", check=False)
-            self.assertEqual(run.returncode, code, run.stdout)
-            return json.loads(run.stdout)
-
-        def names(answer):
-            return [row["name"] for row in answer.get("left_over", [])]
-
-        def forwarded():
-            return [f"{row['first']}/{row['protocol']}" for row in LAB.web_state()["table"] if row["host"] == BOX]
-
-        def clear():
-            LAB.stop_daemon(signal.SIGKILL)
-            LAB.clear_state(account)
-            while webs:
-                LAB.stop_router()
-                LAB.end(webs.pop())
-
-        webs = []
-        self.addCleanup(clear)
+        pages = f"router set {COBBLER} --upnp no"
         for trouble, again in ((False, ""), (True, "save"), (True, pages)):
             with self.subTest(trouble=trouble, again=again):
-                clear()
-                LAB.install()
-                self.forget()
-                LAB.start_web("blind")
-                webs.append(LAB.router)
-                self.saved({("tcp", 5001): (BOX, 5001), ("udp", 5003): (BOX, 5003)}, "1,1,tcp,5001,5001", "2,1,udp,5003,5003")
-                made = LAB.read(RECORD)
-                self.assertIn("are in use", LAB.run("box", f"{TOOL} --forget", check=False).stderr)
-                LAB.start_router()  # somebody has switched its UPnP on
-                self.assertIn("5001/tcp, 5003/udp", told(0, "router set --brand Lab --model One --version 1 --upnp yes")["warnings"][0])
-                self.assertEqual(names(told(6, "status")), ["5001/tcp", "5003/udp"], "until the first save")
-                good = LAB.read(account)
+                warnings = self.go_over("1,1,tcp,5001,5001", "2,1,udp,5003,5003")["warnings"]
+                self.assertIn("5001/tcp, 5003/udp", warnings[0])
+                self.assertEqual(self.names(self.told(6, "status")), ["5001/tcp", "5003/udp"], "until the first save")
+                good = LAB.read(ACCOUNT)
                 if trouble:
-                    LAB.write(account, good.replace("p&ss", "wrong"))
-                    answer = told(4, "close 5003/udp")
-                    self.assertEqual(names(answer), ["5001/tcp", "5003/udp"])
+                    LAB.write(ACCOUNT, good.replace("p&ss", "wrong"))
+                    answer = self.told(4, "close 5003/udp")
+                    self.assertEqual(self.names(answer), ["5001/tcp", "5003/udp"])
                     self.assertNotIn("5003/udp closed", answer["message"])
                     self.assertIn("does not accept the user name or the password", answer["message"])
-                    self.assertEqual(names(told(4, "status")), ["5001/tcp", "5003/udp"])
+                    self.assertEqual(self.names(self.told(4, "status")), ["5001/tcp", "5003/udp"])
                     self.assertTrue(LAB.reaches("udp", 5003))
                     kept = LAB.read(RECORD)
                     self.assertEqual(LAB.run("box", f"{TOOL} --forget").returncode, 0)
-                    self.assertEqual(names(told(0, "status")), [], "taken away by hand, says the user")
+                    self.assertEqual(self.names(self.told(0, "status")), [], "taken away by hand, says the user")
                     LAB.write(RECORD, kept)
-                    LAB.write(account, good)
-                    if again == "save":
-                        rules = LAB.read("/etc/portforward/rule.conf")
-                        LAB.write("/etc/portforward/rule.conf", "no rules\n")
-                        self.assertIn("have taken away what they still forwarded: 5001/tcp, 5003/udp", told(1, "off")["message"])
-                        LAB.write("/etc/portforward/rule.conf", rules)
-                    told(0, again)
-                    told(0, "save")
+                    LAB.write(ACCOUNT, good)
+                    self.told(0, again)
+                    self.told(0, "save")
                 else:
-                    self.assertIn("5003/udp closed", told(0, "close 5003/udp")["message"])
-                    LAB.write(RECORD, re.sub('hardware="[^"]+"', 'hardware="02:00:00:00:00:99"', made))
-                    self.assertIn("the pages of another router that was at this address", "".join(told(0, "status")["warnings"]))
-                    self.assertNotIn("left_over", told(0, "save"))
-                    self.assertEqual((names(told(0, "status")), LAB.read(RECORD).count("00:99")), ([], 2))
+                    self.assertIn("5003/udp closed", self.told(0, "close 5003/udp")["message"])
+                    LAB.write(RECORD, re.sub('hardware="[^"]+"', 'hardware="02:00:00:00:00:99"', self.made))
+                    self.assertIn("the pages of another router that was at this address",
+                                  "".join(self.told(0, "status")["warnings"]))
+                    self.assertNotIn("left_over", self.told(0, "save"))
+                    self.assertEqual((self.names(self.told(0, "status")), LAB.read(RECORD).count("00:99")), ([], 2))
                     LAB.write(RECORD, "")
-                self.assertEqual(names(told(0, "status")), [])
-                self.assertEqual(forwarded(), ["5001/tcp"] if again == pages else [])
-                self.assertEqual(LAB.read(RECORD).count("router_port"), len(forwarded()))
+                self.assertEqual(self.names(self.told(0, "status")), [])
+                self.assertEqual(self.forwarded(), ["5001/tcp"] if again == pages else [])
+                self.assertEqual(LAB.read(RECORD).count("router_port"), len(self.forwarded()))
                 self.assertFalse(LAB.reaches("udp", 5003))
                 if again != "save":  # the pages, as they go, clear the filter of the lab's other router, which does not notice
                     self.assertTrue(LAB.reaches("tcp", 5001))
+                if again == pages:
+                    self.assertIn("are in use", LAB.run("box", f"{TOOL} --forget", check=False).stderr)
 
     def test_a_save_that_ends_while_the_pages_clear_says_so(self):
         """By a signal, or since the rules cannot be written."""
-        account = "/etc/portforward/router_account.conf"
-        self.addCleanup(LAB.clear_state, account)
-        self.addCleanup(LAB.stop_daemon, signal.SIGKILL)
         for cut in ("signal", "read-only"):
             with self.subTest(cut=cut):
-                LAB.install()
-                self.forget()
-                LAB.start_web("blind")
-                web = LAB.router
-                self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
-                LAB.start_router()
-                LAB.run("box", f"{BUILD}/cli/tavoportmap router set --brand Lab --model One --version 1 --upnp yes")
+                self.go_over("1,1,tcp,5001,5001")
                 if cut == "signal":
-                    os.kill(web.pid, signal.SIGSTOP)
+                    clearing = f"{TOOL} --take-away"
+                    os.kill(self.web.pid, signal.SIGSTOP)
                     run = LAB.start("box", f"{BUILD}/cli/tavoportmap", "--json", "close", "5001", stdout=-1, text=True)
-                    wait_for(lambda: LAB.processes_of(f"{TOOL} --take-away"), 5, "the pages are asked")
+                    wait_for(lambda: LAB.processes_of(clearing), 5, "the pages are asked")
                     os.kill(run.pid, signal.SIGINT)
                     told = run.communicate(timeout=20)[0]
-                    os.kill(web.pid, signal.SIGCONT)
+                    os.kill(self.web.pid, signal.SIGCONT)
                     self.assertIn("ended before it stored a rule", told)
-                    wait_for(lambda: not LAB.processes_of(f"{TOOL} --take-away"), 20, "the pages are done")
+                    wait_for(lambda: not LAB.processes_of(clearing), 20, "the pages are done")
                 else:
                     for command in ("mount --bind {0} {0}", "mount -o remount,bind,ro {0}"):
                         os.system(command.format("/etc/portforward"))
@@ -319,9 +320,22 @@ class Manual(unittest.TestCase):
                     self.assertNotIn("Nothing was changed", told)
                     self.assertIn("is closed until a save succeeds", told)
                 self.assertIn('enabled="1"', LAB.read("/etc/portforward/rule.conf"))
-                LAB.stop_router()
-                LAB.end(web)
-                LAB.clear_state(account)
+
+    def test_an_account_of_an_earlier_version_names_no_model(self):
+        """The settings may name it still, or the user says it; and rules that cannot be read are in nobody's way."""
+        for settings, named in ((f"{COBBLER} --max-rules 0", True), (LAB_ONE, False)):
+            with self.subTest(settings=settings):
+                self.go_over("1,1,tcp,5001,5001", settings=settings)
+                LAB.write(ACCOUNT, re.sub("(?m)^(brand|model|version)=.*\n", "", LAB.read(ACCOUNT)))
+                LAB.write("/etc/portforward/rule.conf", "no rules\n")
+                if not named:
+                    answer = self.told(1, "off")
+                    self.assertEqual((self.names(answer), self.forwarded()), (["5001/tcp"], ["5001/tcp"]))
+                    self.assertRegex(answer["message"], "router set' with --upnp no and the --brand.*with --upnp yes goes back")
+                    self.told(0, f"router set {COBBLER} --upnp no")
+                    self.told(0, f"router set {LAB_ONE} --upnp yes")
+                self.assertIn("have taken away what they still forwarded: 5001/tcp", self.told(1, "off")["message"])
+                self.assertEqual((self.forwarded(), self.names(self.told(1, "status"))), ([], []))
 
 
 class Database(unittest.TestCase):
