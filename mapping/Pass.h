@@ -33,6 +33,9 @@ struct Habits {
     std::set<MappingKey> setLost = {};  // where it said yes at the last asking, and has shown nothing yet
 };
 
+// What another daemon of this box sees to, by place the port of the box: what leads there is not taken away.
+using Others = std::map<MappingKey, uint16_t>;
+
 struct Surroundings {
     std::string szBox;               // the box's own address
     std::function<int64_t()> fnNow;  // seconds of boot time
@@ -40,8 +43,7 @@ struct Surroundings {
     std::function<bool()> fnSave;  // puts the record where it survives us; whether it is there
     // Is told of each step that changes something at the router, and why.
     std::function<void(const RouterMapping&, const Step&)> fnTell = [](const RouterMapping&, const Step&) {};
-    // What another daemon of this box sees to, by place the port of the box: what leads there is not taken away.
-    std::map<MappingKey, uint16_t> mapOthers = {};
+    Others mapOthers = {};
     std::function<void()> fnHeard = {};  // may be empty; is told of each answer of the router
 };
 

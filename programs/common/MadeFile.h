@@ -14,6 +14,8 @@
 
 namespace tavo {
 
+inline constexpr char kUpnpMadeFile[] = "/var/lib/tavo/upnp_made.conf";
+
 class MadeFile {
 public:
     explicit MadeFile(const char* szPath)

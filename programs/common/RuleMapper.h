@@ -66,7 +66,7 @@ protected:
     void Heard() { mHeard = BootClock::now(); }
     uint32_t WishedLease() const { return mNWishedLease; }
     // What a pass leaves alone, as the other daemon has the turn: by place, the port of the box.
-    const std::map<MappingKey, uint16_t>& Others() const { return mMapOthers; }
+    const tavo::Others& Others() const { return mMapOthers; }
 
 private:
     bool MendRunKeys();
@@ -93,7 +93,7 @@ private:
     Announcements mAnnouncements;
     std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
     RouterTurn mTurn;
-    std::map<MappingKey, uint16_t> mMapOthers;
+    tavo::Others mMapOthers;
     std::string mSzGateway;
     std::string mSzBox;
     std::string mSzHardware;  // of the gateway, as it was last seen

@@ -25,13 +25,14 @@ std::vector<RouterMapping> MappingsOf(const std::vector<Job>& rgJobs) {
 
 }  // namespace
 
-std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vector<Job>& rgWanted) {
+std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vector<Job>& rgWanted,
+                                    const Others& mapOthers) {
     const StepResult login = mSession.Perform(kStepLogin);
     Record& record = mMade.Get();
     record.TurnTo({szGateway, HardwareAddress(szGateway)});
     record.Prune(BootSeconds());
     if (login.blDone) {
-        Bring(rgWanted);
+        Bring(rgWanted, mapOthers);
         mSession.Perform(kStepLogout);  // a router that does not let go of a session ends it by itself
         return mRgRefusals;
     }
@@ -39,7 +40,7 @@ std::vector<Refusal> Forwarder::Run(const std::string& szGateway, const std::vec
     return mRgRefusals;
 }
 
-void Forwarder::Bring(const std::vector<Job>& rgWanted) {
+void Forwarder::Bring(const std::vector<Job>& rgWanted, const Others& mapOthers) {
     std::vector<RouterMapping> rgListed;
     if (!mRouter.List(rgListed).IsOk()) {
         RefuseRun("list of forwards", mRouter.Listing());
@@ -47,9 +48,10 @@ void Forwarder::Bring(const std::vector<Job>& rgWanted) {
         return;
     }
     Habits habit{.nLease = 0, .blPermanentOnly = true};
-    const PassResult result = BringInLine(mRouter, MappingsOf(rgWanted), mMade.Get(), habit,
-                                          Around(
-                                              mSzBox, [] { return false; }, mMade));
+    Surroundings around = Around(
+        mSzBox, [] { return false; }, mMade);
+    around.mapOthers = mapOthers;
+    const PassResult result = BringInLine(mRouter, MappingsOf(rgWanted), mMade.Get(), habit, around);
     for (size_t i = rgWanted.size(); i < result.rgOutcomes.size(); ++i) {  // what is left over
         Refuse(result.rgOutcomes[i], {}, RefusalKind::kRemoval);
     }

@@ -18,10 +18,11 @@ public:
         : mSession(session), mMade(made), mSzBox(std::move(szBox)), mRouter(session, operations) {}
 
     // Login to logout. What is not as it should be afterwards, with the reasons; empty: all is in place.
-    std::vector<Refusal> Run(const std::string& szGateway, const std::vector<Job>& rgWanted);
+    std::vector<Refusal> Run(const std::string& szGateway, const std::vector<Job>& rgWanted,
+                             const Others& mapOthers = {});
 
 private:
-    void Bring(const std::vector<Job>& rgWanted);
+    void Bring(const std::vector<Job>& rgWanted, const Others& mapOthers);
     void Refuse(const Outcome& outcome, const Job& job, RefusalKind enKind);
     void RefuseAll(const std::vector<Job>& rgWanted, const StepResult& result);
     void RefuseRun(const char* szWhat, const StepResult& result);

@@ -226,7 +226,8 @@ std::string RouterWhy(const std::vector<Refusal>& rgRefusals) {
     return itRun == rgRefusals.end() ? "" : itRun->szWhy;
 }
 
-int Bring(const KnownRouter& router, tavo::MadeFile& made, tavo::JobSet jobs, bool blInUse) {
+int Bring(const KnownRouter& router, tavo::MadeFile& made, tavo::JobSet jobs, const tavo::Others& mapOthers,
+          bool blInUse) {
     tavo::WebClient client(router.web, std::chrono::steady_clock::now() + kRunLimit);
     tavo::Session session(client, router.operations,
                           {{"user", router.web.szUser},
@@ -236,7 +237,7 @@ int Bring(const KnownRouter& router, tavo::MadeFile& made, tavo::JobSet jobs, bo
                            {"box", router.szBox}});
     tavo::RunResult result{.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = blInUse};
     tavo::Forwarder forwarder(session, router.operations, made, router.szBox);
-    result.rgRefusals = forwarder.Run(router.szGateway, jobs.rgJobs);
+    result.rgRefusals = forwarder.Run(router.szGateway, jobs.rgJobs, mapOthers);
     result.enRouter = StateAfter(session.LastTrouble());
     result.szRouterWhy = RouterWhy(result.rgRefusals);
     result.rgRefusals.insert(result.rgRefusals.end(), jobs.rgRefusals.begin(), jobs.rgRefusals.end());
@@ -257,7 +258,7 @@ int Run() {
     }
     tavo::MadeFile made(kMadeFile);
     tavo::TakeOverEarlierRecord(made);
-    return Bring(router, made, std::move(jobs), true);
+    return Bring(router, made, std::move(jobs), {}, true);
 }
 
 tavo::RouterName NameOf(const KnownRouter& router) {
@@ -274,6 +275,20 @@ tavo::RunResult LeftBy(tavo::Record& record, const KnownRouter& router, const st
     return result;
 }
 
+// The pages may list what upnpd has made, with our mark. Where both have made something nobody can tell whose it is: it
+// goes, for the pages would keep it for ever; upnpd makes it anew.
+tavo::Others MadeByUpnpd(const tavo::Record& record) {
+    tavo::Others mapOthers;
+    tavo::Record upnpd = tavo::MadeFile(tavo::kUpnpMadeFile).Get();
+    upnpd.TurnTo(record.Router());
+    for (const auto& [key, made] : upnpd.Here()) {
+        if (!record.Here().contains(key)) {
+            mapOthers.emplace(key, made.nBoxPort);
+        }
+    }
+    return mapOthers;
+}
+
 // The rules are carried out in another way by now, or by nobody: none of them counts here.
 int TakeAway() {
     KnownRouter router;
@@ -283,7 +298,7 @@ int TakeAway() {
     tavo::TakeOverEarlierRecord(made);
     const tavo::RunResult left = LeftBy(made.Get(), router, szWhy);
     if (blKnown && !left.rgRefusals.empty()) {
-        return Bring(router, made, {}, false);
+        return Bring(router, made, {}, MadeByUpnpd(made.Get()), false);
     }
     tavo::Tell(left);
     return left.rgRefusals.empty() && !router.blNoGateway ? kAllInPlace : kNotTried;

@@ -15,7 +15,6 @@ namespace tavo {
 
 namespace {
 
-constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
 constexpr char kNoIgd[] = "noigd";
 constexpr int kDiscoveryMilliseconds = 8000;
 constexpr int kOutsideMilliseconds = 2000;
@@ -26,7 +25,7 @@ constexpr auto kEcho = std::chrono::seconds(3);  // until what we have changed h
 constexpr DaemonNames kUpnpNames{
     "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
 
-UpnpMapper::UpnpMapper() : RuleMapper(kUpnpNames), mMade(kMadeFile) {}
+UpnpMapper::UpnpMapper() : RuleMapper(kUpnpNames), mMade(kUpnpMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();

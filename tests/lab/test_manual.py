@@ -337,6 +337,17 @@ class Manual(unittest.TestCase):
                 self.assertIn("have taken away what they still forwarded: 5001/tcp", self.told(1, "off")["message"])
                 self.assertEqual((self.forwarded(), self.names(self.told(1, "status"))), ([], []))
 
+    def test_what_upnpd_has_made_is_left_where_the_pages_list_it(self):
+        self.go_over("1,1,udp,5003,5003", flavour="form")
+        self.told(0, "open 5001")
+        LAB.write(RECORD, self.made)
+        for protocol, port in (("udp", 5003), ("tcp", 5001)):
+            row = {"name": "tavo:x", "protocol": protocol, "first": port, "last": port, "host": BOX, "port": port}
+            LAB.run("router", "curl -s -X POST --data-binary @- http://127.0.0.1:8080/upnp", input=json.dumps(row))
+        self.assertEqual(self.forwarded(), ["5003/udp", "5001/tcp"])
+        self.assertEqual(LAB.run("box", f"{TOOL} --take-away").returncode, 0)
+        self.assertEqual(self.forwarded(), ["5001/tcp"])
+
 
 class Database(unittest.TestCase):
     def test_operations_that_cannot_be_performed(self):

@@ -78,6 +78,9 @@ class Page(http.server.BaseHTTPRequestHandler):
         COUNT[path] = COUNT.get(path, 0) + 1
         if path == "/state":
             return self.answer(json.dumps({"table": TABLE, "count": COUNT}))
+        if path == "/upnp":  # the pages list what was made by UPnP, too
+            add(**json.loads(body))
+            return self.answer("")
         if path == "/move":  # the box had another address when its forwards were made
             for row in TABLE[1:]:
                 row["host"] = urllib.parse.parse_qs(body)["host"][0]
