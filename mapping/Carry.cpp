@@ -79,7 +79,8 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
     mPlaces.habit.setLost.erase(place.key);
     RouterReply reply = Note(mPlaces.router.Remove(place.gone));
     const Made* pMade = mPlaces.MadeAt(place);
-    if (mPlaces.what.blForm && !mPlaces.what.blShows && reply.enReply == Reply::kNoSuchEntry && pMade != nullptr &&
+    const bool blUnseen = mPlaces.what.blForm && !mPlaces.what.blShows;
+    if (blUnseen && reply.enReply == Reply::kNoSuchEntry && pMade != nullptr &&
         pMade->other.nBoxPort != 0) {  // the change of it may not have been applied
         place.gone.szClient = pMade->other.szClient;
         place.gone.nBoxPort = pMade->other.nBoxPort;
@@ -89,7 +90,8 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
         place.kept = std::move(reply);
         return false;
     }
-    if (reply.IsOk() && (mPlaces.what.blForm || mPlaces.what.blShows)) {
+    // Such a form has nothing there by what it was told last, which may not have taken effect either.
+    if (blUnseen || (reply.IsOk() && mPlaces.what.blShows)) {
         place.before = mPlaces.rows.try_emplace(place.key, RowOf(place.gone, true, mPlaces.Now())).first->second;
         place.before->szClient = place.gone.szClient;  // which of the two that the row may be of
         place.before->nBoxPort = place.gone.nBoxPort;

@@ -123,7 +123,8 @@ RouterReply PagesRouter::Remove(const RouterMapping& mapping) {
     mBlStale = true;
     mBlChanged = mBlChanged || result.blDone;
     Read();
-    return ReplyOf(result);
+    return result.blDone && result.blWasGone && !What().blShows ? RouterReply{Reply::kNoSuchEntry, "gone"}
+                                                                : ReplyOf(result);
 }
 
 RouterReply PagesRouter::Apply() {

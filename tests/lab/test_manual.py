@@ -348,6 +348,20 @@ class Manual(unittest.TestCase):
         self.assertEqual(LAB.run("box", f"{TOOL} --take-away").returncode, 0)
         self.assertEqual(self.forwarded(), ["5001/tcp"])
 
+    def test_what_is_gone_by_the_pages_word_may_be_there_still(self):
+        """A change that was not applied, and one more: what is in force has another port of the box than both."""
+        LAB.start_web("blind", "applies_once")
+        place = "/etc.defaults/portforward/routerdb/Cobbler/Gate/1/router."
+        LAB.write(place + "ops", LAB.read(place + "ops").replace("delete?", "delete?port={box_first}&") +
+                  '[apply]\npath="/apply"\nexpect text="OK"\n')
+        LAB.write(place + "des", LAB.read(place + "des").replace("[PF port page]\n", '[PF port page]\nchange router port="yes"\n'))
+        self.saved({("tcp", 5001): (BOX, 5001)}, "1,1,tcp,5001,5001")
+        for port in (5002, 5003):
+            LAB.save(f"1,1,tcp,5001,{port}")
+            self.assertEqual(self.forwards(), {("tcp", 5001): (BOX, 5001), **FOREIGN})
+        os.unlink(EVENTS)
+        self.saved({})
+
 
 class Database(unittest.TestCase):
     def test_operations_that_cannot_be_performed(self):

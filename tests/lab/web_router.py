@@ -25,6 +25,7 @@ FLAVOUR, FAULT, PORT = sys.argv[1], sys.argv[2], int(sys.argv[3])
 NONCE = secrets.token_hex(8)
 TABLE, COUNT = [], {}  # rows: dict of id, name, protocol, first, last, host, port
 STATE = {"token": "", "cookie": None, "next": 1}
+APPLIED = []  # what is in force of the table, by pages that apply
 
 
 TABLE.append({"id": 0, "name": "tavo:another box", "protocol": "tcp", "first": 9999, "last": 9999,
@@ -167,8 +168,12 @@ class Page(http.server.BaseHTTPRequestHandler):
             return self.answer("", 401, WWW_Authenticate='Basic realm="router"')
         if path == "/add":
             done = add(**query)
+        elif path == "/apply":
+            done = FAULT != "applies_once" or COUNT[path] not in (2, 3)
+            (APPLIED if done else TABLE)[:] = TABLE if done else APPLIED
         else:
-            left = [r for r in TABLE if (r["protocol"], str(r["first"])) != (query["protocol"], query["first"])]
+            left = [r for r in TABLE if (r["protocol"], str(r["first"])) != (query["protocol"], query["first"])
+                    or query.get("port", str(r["port"])) != str(r["port"])]
             if FAULT == "first_delete_fails" and COUNT[path] == 1:
                 return self.answer("busy", 500)
             done = len(left) < len(TABLE)
@@ -176,7 +181,7 @@ class Page(http.server.BaseHTTPRequestHandler):
         program()
         if FAULT == "hangs_after_add" and path == "/add":
             return time.sleep(600)
-        return self.answer("OK" if done else ("IN USE" if path == "/add" else "NO SUCH RULE"))
+        return self.answer("OK" if done else {"/add": "IN USE", "/apply": "FAILED"}.get(path, "NO SUCH RULE"))
 
 
 class Server(http.server.ThreadingHTTPServer):

@@ -269,6 +269,9 @@ public:
         BeforeChange();
         mMapTable.erase({"TCP", mNTornAway});
         const auto it = mMapTable.find(tavo::KeyOf(mapping));
+        if (mBlSaysGone) {
+            return {tavo::Reply::kNoSuchEntry, "no such rule"};
+        }
         return !mBlShows && mNRemoveCode == tavo::kWireOk && it != mMapTable.end() &&
                        it->second.nBoxPort != mapping.nBoxPort
                    ? RouterReply{tavo::Reply::kNoSuchEntry, "no such rule"}
@@ -299,15 +302,17 @@ public:
     bool mBlShows = true;
     bool mBlHidesClient = false;
     bool mBlApplies = true;
+    bool mBlSaysGone = false;
     std::optional<std::map<tavo::MappingKey, RouterMapping>> mMapBefore;  // what is there if that is not applied
     uint16_t mNTornAway = 0;                                              // goes with any other one
     int mNApplied = 0;
 };
 
 // Where a form shows no list: what is there is known however often a change of it takes no effect, or its removal is
-// not answered.
+// not answered, or there is nothing to remove by a word that did not take effect either.
 TEST(Mapping, WhatABlindFormHasIsKnownWhateverWasAskedForSince) {
-    for (const bool blSilent : {false, true}) {
+    for (const auto& [blSilent, blSaysGone] :
+         {std::pair(false, false), std::pair(true, false), std::pair(false, true)}) {
         FormRouter router;
         router.mBlShows = false;
         router.mSzRewritten = "-";
@@ -318,11 +323,16 @@ TEST(Mapping, WhatABlindFormHasIsKnownWhateverWasAskedForSince) {
         core.Run(router, {Entry(4, 9, "", "tavo:c")});
         const int nCode = blSilent ? int{tavo::kWireTimeout} : int{tavo::kWireOk};
         router.mNRemoveCode = router.mNAddCode = nCode;
+        router.mBlSaysGone = blSaysGone;
         core.Run(router, {Entry(4, blSilent ? 9 : 10, "", "tavo:c")});
+        if (blSaysGone) {
+            core.Run(router, {});
+            router.mBlSaysGone = false;
+        }
         router.mNRemoveCode = router.mNAddCode = tavo::kWireOk;
         router.mBlApplies = true;
         core.Run(router, {});
-        EXPECT_TRUE(router.mMapTable.empty()) << blSilent;
+        EXPECT_TRUE(router.mMapTable.empty()) << blSilent << blSaysGone;
     }
 }
 
