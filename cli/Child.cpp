@@ -16,7 +16,7 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-pid_t Spawn(const std::vector<std::string>& rgszArguments, int fdOutput) {
+pid_t Spawn(const std::vector<std::string>& rgszArguments, int fdOutput, bool blOwnSession) {
     std::vector<char*> rgpArguments;
     rgpArguments.reserve(rgszArguments.size() + 1);
     for (const std::string& szArgument : rgszArguments) {
@@ -30,8 +30,12 @@ pid_t Spawn(const std::vector<std::string>& rgszArguments, int fdOutput) {
     posix_spawn_file_actions_adddup2(&actions, fdOutput, STDOUT_FILENO);
     posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
     posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);  // the router lock above all
+    posix_spawnattr_t attributes;
+    posix_spawnattr_init(&attributes);
+    posix_spawnattr_setflags(&attributes, static_cast<short>(blOwnSession ? int{POSIX_SPAWN_SETSID} : 0));
     pid_t nPid = -1;
-    const int nError = posix_spawn(&nPid, rgpArguments[0], &actions, nullptr, rgpArguments.data(), rgpEnvironment);
+    const int nError = posix_spawn(&nPid, rgpArguments[0], &actions, &attributes, rgpArguments.data(), rgpEnvironment);
+    posix_spawnattr_destroy(&attributes);
     posix_spawn_file_actions_destroy(&actions);
     return nError == 0 ? nPid : -1;
 }
@@ -56,12 +60,13 @@ bool ReadAll(int fd, Clock::time_point end, size_t nMost, std::string& szText) {
 
 }  // namespace
 
-std::string OutputOf(const std::vector<std::string>& rgszArguments, std::chrono::milliseconds limit, size_t nMost) {
+std::string OutputOf(const std::vector<std::string>& rgszArguments, std::chrono::milliseconds limit, size_t nMost,
+                     bool blOwnSession) {
     int rgFds[2] = {-1, -1};
     if (pipe2(rgFds, O_CLOEXEC) != 0) {
         return "";
     }
-    const pid_t nPid = Spawn(rgszArguments, rgFds[1]);
+    const pid_t nPid = Spawn(rgszArguments, rgFds[1], blOwnSession);
     close(rgFds[1]);
     std::string szText;
     const bool blWhole = nPid > 0 && ReadAll(rgFds[0], Clock::now() + limit, nMost, szText);

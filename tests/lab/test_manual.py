@@ -305,13 +305,15 @@ class Manual(unittest.TestCase):
                 if cut == "signal":
                     clearing = f"{TOOL} --take-away"
                     os.kill(self.web.pid, signal.SIGSTOP)
-                    run = LAB.start("box", f"{BUILD}/cli/tavoportmap", "--json", "close", "5001", stdout=-1, text=True)
+                    run = LAB.start("box", f"{BUILD}/cli/tavoportmap", "--json", "close", "5001", stdout=-1, text=True,
+                                    start_new_session=True)
                     wait_for(lambda: LAB.processes_of(clearing), 5, "the pages are asked")
-                    os.kill(run.pid, signal.SIGINT)
+                    os.killpg(run.pid, signal.SIGINT)  # as Ctrl-C does
                     told = run.communicate(timeout=20)[0]
                     os.kill(self.web.pid, signal.SIGCONT)
                     self.assertIn("ended before it stored a rule", told)
                     wait_for(lambda: not LAB.processes_of(clearing), 20, "the pages are done")
+                    self.assertEqual(self.forwarded(), [])
                 else:
                     for command in ("mount --bind {0} {0}", "mount -o remount,bind,ro {0}"):
                         os.system(command.format("/etc/portforward"))
