@@ -36,21 +36,25 @@ using tavo::Refusal;
 using tavo::Value;
 
 constexpr char kHelp[] =
-    "Usage: tavoportforward [--take-away | --left | --forget | --version | --check FILE... | --help]\n"
+    "Usage: tavoportforward [--if-used | --take-away | --left | --forget | --version | --check FILE... |\n"
+    "       --help]\n"
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
     "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
     "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
     "for: /var/lib/tavo/pages_made.conf remembers it, and is the only memory of a router that shows no list.\n"
     "What became of each port stands in /run/tavo/tavoportforward.json.\n"
     "\n"
-    "  --take-away takes away all that it made, also when UPnP or NAT-PMP drives the router by now: with the\n"
-    "              account that /etc/portforward/router_account.conf keeps since\n"
-    "  --left      says, as that file does, what the record has; asks no router\n"
-    "  --forget    drops from the record what this router's pages forward while they are not in use: for who has\n"
-    "              taken it away by hand\n"
-    "  --version   the version of the operations syntax that this tool understands\n"
-    "  --check     says of router.ops and router.des (by that ending) files what is wrong with them\n"
-    "  --help      this text\n"
+    "  --if-used       does nothing where the settings have the router driven in another way\n"
+    "  --take-away     takes away all that it made, also when UPnP or NAT-PMP drives the router by now: with the\n"
+    "                  account that /etc/portforward/router_account.conf keeps since\n"
+    "  --left          says, as that file does, what the record has; asks no router\n"
+    "  --forget        drops from the record what this router's pages forward while they are not in use: for who\n"
+    "                  has taken it away by hand\n"
+    "  --version       the version of the operations syntax that this tool understands\n"
+    "  --check         says of router.ops and router.des (by that ending) files what is wrong with them\n"
+    "  --help          this text\n"
+    "\n"
+    "Under its other name, tavopages, nobody takes it for a save under way.\n"
     "\n"
     "Exit status: 0 all is in place (or good); 1 some forwards are not (see the system log\n"
     "and /var/log/tavo/event.log), or a checked file is bad; 2 unknown argument; 3 nothing could be tried.\n";
@@ -261,6 +265,11 @@ int Run() {
     return Bring(router, made, std::move(jobs), {}, true);
 }
 
+// By the settings that a save goes by, whatever the gateway is.
+int RunIfUsed() {
+    return IsInUse(ConfList(TAVOPFGwRouterConfGet()).get()) ? Run() : kAllInPlace;
+}
+
 tavo::RouterName NameOf(const KnownRouter& router) {
     return {router.szGateway, tavo::HardwareAddress(router.szGateway)};
 }
@@ -358,6 +367,18 @@ int Locked(int (*fnRun)()) {
     return fnRun();
 }
 
+struct Mode {
+    std::string_view szOption;
+    int (*fnRun)();
+    bool blLocks = true;
+};
+
+constexpr Mode kModes[] = {{"", Run},
+                           {"--if-used", RunIfUsed},
+                           {"--take-away", TakeAway},
+                           {"--forget", ForgetLeft},
+                           {"--left", ShowLeft, false}};
+
 int Check(char** pszPaths) {
     int nStatus = kAllInPlace;
     for (; *pszPaths != nullptr; ++pszPaths) {
@@ -378,10 +399,9 @@ int Check(char** pszPaths) {
 
 int main(int argc, char** argv) {
     const std::string_view szOption = argc == 2 ? argv[1] : "";
-    const bool blTakeAway = szOption == "--take-away";
-    const bool blLeft = szOption == "--left";
-    const bool blForget = szOption == "--forget";
-    if (argc > 1 && !blTakeAway && !blLeft && !blForget) {
+    const auto pMode =
+        std::find_if(std::begin(kModes), std::end(kModes), [&](const Mode& mode) { return mode.szOption == szOption; });
+    if (argc > 2 || (argc == 2 && szOption.empty()) || pMode == std::end(kModes)) {
         if (std::strcmp(argv[1], "--version") == 0) {
             std::printf("syntax version=%d\n", tavo::kSyntaxVersion);
             return kAllInPlace;
@@ -401,7 +421,7 @@ int main(int argc, char** argv) {
     signal(SIGPIPE, SIG_IGN);
     openlog("tavoportforward", LOG_PID, LOG_DAEMON);
     try {
-        return blLeft ? ShowLeft() : Locked(blTakeAway ? TakeAway : blForget ? ForgetLeft : Run);
+        return pMode->blLocks ? Locked(pMode->fnRun) : pMode->fnRun();
     } catch (const std::exception& error) {
         return NotTried(error.what());
     }
