@@ -69,7 +69,7 @@ std::optional<Published> LeftByPages() {
 
 std::vector<PublishedLeftOver> TakeAwayByPages() {
     const time_t nStart = std::time(nullptr);
-    OutputOf({kProgram, "--take-away"}, kTakeAway, kMostBytes, true);
+    OutputOf({kProgram, "--clear-unused"}, kTakeAway, kMostBytes, true);
     auto left = PagesWord(false);
     const bool blEnded = left && left->nAt >= nStart;
     if (!blEnded) {

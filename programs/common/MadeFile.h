@@ -15,6 +15,8 @@
 namespace tavo {
 
 inline constexpr char kUpnpMadeFile[] = "/var/lib/tavo/upnp_made.conf";
+inline constexpr char kPagesMadeFile[] = "/var/lib/tavo/pages_made.conf";
+inline constexpr char kEarlierPagesFile[] = "/var/lib/tavo/manual_router.made";  // of an earlier version
 
 class MadeFile {
 public:

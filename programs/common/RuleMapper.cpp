@@ -187,6 +187,9 @@ int RuleMapper::Run(bool blRequested, const std::function<bool()>& fnStop) {
             mTurn.GiveBack();
         }
     }
+    if (blRequested && !result.blStopped && mWanted.blSwitchedOn && !mSzGateway.empty()) {
+        mPages.Clear({mSzGateway, mSzHardware});
+    }
     const int nSeconds = SecondsToNext(result, blRequested);
     if (!result.blStopped) {
         PublishPass(std::move(result), blRequested, nSeconds, fnStop);

@@ -23,6 +23,7 @@
 #include "programs/common/RuleFile.h"
 #include "programs/common/Teller.h"
 #include "programs/common/ToldFile.h"
+#include "programs/common/UnusedPages.h"
 #include "wire/upnp/Notify.h"
 
 namespace tavo {
@@ -33,9 +34,13 @@ public:
     bool IsSwitchedOn() const final { return IsRunKeyOn(mNames.szRunKey); }
     bool Withdraw(const std::function<bool()>& fnEnd) final;
     bool OnNetworkChange() final;
-    std::vector<int> WakeFds() const override { return {mAnnouncements.Fd()}; }
-    // The gateway has begun anew, by what it announces as a UPnP device, which most are whatever maps ports there.
-    bool OnWake() override { return mAnnouncements.TakeNews(mSzGateway); }
+    std::vector<int> WakeFds() const override { return {mAnnouncements.Fd(), mPages.Fd()}; }
+    // The gateway has begun anew, by what it announces as a UPnP device, which most are whatever maps ports there; or
+    // its own pages have taken away what they forwarded.
+    bool OnWake() override {
+        const bool blFree = mPages.TakeEnd();
+        return mAnnouncements.TakeNews(mSzGateway) || blFree;
+    }
 
 protected:
     explicit RuleMapper(const DaemonNames& names);
@@ -91,6 +96,7 @@ private:
     bool mBlRulesRead = false;
     bool mBlMended = false;  // no killed save or detection has left our run key off
     Announcements mAnnouncements;
+    UnusedPages mPages;
     std::string mSzNetwork;  // what the last pass, or the last look since, saw of it
     RouterTurn mTurn;
     tavo::Others mMapOthers;

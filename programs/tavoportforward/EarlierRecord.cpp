@@ -14,7 +14,6 @@ namespace tavo {
 
 namespace {
 
-constexpr char kFile[] = "/var/lib/tavo/manual_router.made";  // one section for each forward
 constexpr char kAside[] = "/var/lib/tavo/manual_router.damaged";
 
 uint16_t Port(const std::string& szText) {
@@ -23,6 +22,7 @@ uint16_t Port(const std::string& szText) {
     return nPort;
 }
 
+// One section for each forward.
 void TakeOver(const Section& section, Record& record) {
     std::map<std::string, std::string> mapValues;
     for (const Pair& pair : section.rgPairs) {
@@ -43,10 +43,10 @@ void TakeOver(const Section& section, Record& record) {
 }  // namespace
 
 void TakeOverEarlierRecord(MadeFile& made) {
-    if (TLIBCFileExist(kFile) != 1) {
+    if (TLIBCFileExist(kEarlierPagesFile) != 1) {
         return;
     }
-    const auto szText = ReadFile(kFile);
+    const auto szText = ReadFile(kEarlierPagesFile);
     size_t nLost = 0;
     for (const Section& section : ReadableSections(szText.value_or(""), &nLost)) {
         TakeOver(section, made.Get());
@@ -55,10 +55,10 @@ void TakeOverEarlierRecord(MadeFile& made) {
         return;
     }
     if (szText && nLost == 0) {
-        unlink(kFile);
-    } else if (std::rename(kFile, kAside) == 0) {
-        SysLog(LOG_ERR, "%s cannot be read%s: mappings made earlier are not known by it; it is kept as %s", kFile,
-               szText ? " as a whole" : "", kAside);
+        unlink(kEarlierPagesFile);
+    } else if (std::rename(kEarlierPagesFile, kAside) == 0) {
+        SysLog(LOG_ERR, "%s cannot be read%s: mappings made earlier are not known by it; it is kept as %s",
+               kEarlierPagesFile, szText ? " as a whole" : "", kAside);
     }
 }
 

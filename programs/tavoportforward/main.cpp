@@ -36,8 +36,8 @@ using tavo::Refusal;
 using tavo::Value;
 
 constexpr char kHelp[] =
-    "Usage: tavoportforward [--if-used | --take-away | --left | --forget | --version | --check FILE... |\n"
-    "       --help]\n"
+    "Usage: tavoportforward [--if-used | --take-away | --clear-unused | --left | --forget | --version |\n"
+    "       --check FILE... | --help]\n"
     "Writes the enabled rules of /etc/portforward/rule.conf into the router in front of this box, through the\n"
     "web pages that its description knows (/etc/tavo/routerdb, /etc.defaults/portforward/routerdb), with the\n"
     "account that /etc/portforward/router.conf holds for it. Takes away what it made earlier and no rule asks\n"
@@ -47,6 +47,7 @@ constexpr char kHelp[] =
     "  --if-used       does nothing where the settings have the router driven in another way\n"
     "  --take-away     takes away all that it made, also when UPnP or NAT-PMP drives the router by now: with the\n"
     "                  account that /etc/portforward/router_account.conf keeps since\n"
+    "  --clear-unused  the same, and nothing while the pages are in use\n"
     "  --left          says, as that file does, what the record has; asks no router\n"
     "  --forget        drops from the record what this router's pages forward while they are not in use: for who\n"
     "                  has taken it away by hand\n"
@@ -58,7 +59,6 @@ constexpr char kHelp[] =
     "\n"
     "Exit status: 0 all is in place (or good); 1 some forwards are not (see the system log\n"
     "and /var/log/tavo/event.log), or a checked file is bad; 2 unknown argument; 3 nothing could be tried.\n";
-constexpr char kMadeFile[] = "/var/lib/tavo/pages_made.conf";
 // The settings of the pages while UPnP or NAT-PMP drives the router.
 constexpr char kAside[] = "/etc/portforward/router_account.conf";
 // How pages that are not in use get an account with a description again.
@@ -260,7 +260,7 @@ int Run() {
     if (!jobs.blReadable) {
         return NotTried("the rules cannot be read", router);
     }
-    tavo::MadeFile made(kMadeFile);
+    tavo::MadeFile made(tavo::kPagesMadeFile);
     tavo::TakeOverEarlierRecord(made);
     return Bring(router, made, std::move(jobs), {}, true);
 }
@@ -303,7 +303,7 @@ int TakeAway() {
     KnownRouter router;
     std::string szWhy;
     const bool blKnown = Load(router, true, szWhy);
-    tavo::MadeFile made(kMadeFile);
+    tavo::MadeFile made(tavo::kPagesMadeFile);
     tavo::TakeOverEarlierRecord(made);
     const tavo::RunResult left = LeftBy(made.Get(), router, szWhy);
     if (blKnown && !left.rgRefusals.empty()) {
@@ -313,6 +313,15 @@ int TakeAway() {
     return left.rgRefusals.empty() && !router.blNoGateway ? kAllInPlace : kNotTried;
 }
 
+// Whoever started this may have waited for its turn while the settings went over to the pages.
+int ClearUnused() {
+    KnownRouter router;
+    std::string szWhy;
+    const ConfList pRouters(TAVOPFGwRouterConfGet());
+    const bool blInUse = FindAddresses(router, szWhy) && IsInUse(SectionOf(pRouters.get(), router.szGateway));
+    return blInUse ? kAllInPlace : TakeAway();
+}
+
 int ShowLeft() {
     KnownRouter router;
     std::string szWhy;
@@ -320,7 +329,7 @@ int ShowLeft() {
     szWhy = blKnown
                 ? "the router's own pages forward it; 'sudo tavoportmap off', or the next save, has them take it away"
                 : "the router's own pages forward it: take it away there (" + szWhy + ")";
-    tavo::Record record = tavo::MadeFile(kMadeFile).Get();
+    tavo::Record record = tavo::MadeFile(tavo::kPagesMadeFile).Get();
     tavo::RunResult left = LeftBy(record, router, szWhy);
     const size_t nHere = record.Here().size();
     record.TurnTo({router.szGateway, ""});
@@ -347,12 +356,12 @@ int ForgetLeft() {
                    stderr);
         return kNotTried;
     }
-    tavo::MadeFile made(kMadeFile);
+    tavo::MadeFile made(tavo::kPagesMadeFile);
     tavo::TakeOverEarlierRecord(made);
     made.Get().TurnTo(NameOf(router));
     made.Get().Here().clear();
     if (!made.Save()) {
-        std::fprintf(stderr, "tavoportforward: %s cannot be written\n", kMadeFile);
+        std::fprintf(stderr, "tavoportforward: %s cannot be written\n", tavo::kPagesMadeFile);
         return kNotTried;
     }
     tavo::Tell({.szGateway = router.szGateway, .szBox = router.szBox, .blInUse = false});
@@ -376,6 +385,7 @@ struct Mode {
 constexpr Mode kModes[] = {{"", Run},
                            {"--if-used", RunIfUsed},
                            {"--take-away", TakeAway},
+                           {"--clear-unused", ClearUnused},
                            {"--forget", ForgetLeft},
                            {"--left", ShowLeft, false}};
 

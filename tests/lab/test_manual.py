@@ -296,6 +296,8 @@ class Manual(unittest.TestCase):
                     self.assertTrue(LAB.reaches("tcp", 5001))
                 if again == pages:
                     self.assertIn("are in use", LAB.run("box", f"{TOOL} --forget", check=False).stderr)
+                    self.assertEqual(LAB.run("box", f"{TOOL} --clear-unused").returncode, 0)
+                    self.assertEqual(self.forwarded(), ["5001/tcp"], "who has waited for its turn looks once more")
 
     def test_a_save_that_ends_while_the_pages_clear_says_so(self):
         """By a signal, or since the rules cannot be written."""
@@ -303,7 +305,7 @@ class Manual(unittest.TestCase):
             with self.subTest(cut=cut):
                 self.go_over("1,1,tcp,5001,5001")
                 if cut == "signal":
-                    clearing = f"{TOOL} --take-away"
+                    clearing = f"{TOOL} --clear-unused"
                     os.kill(self.web.pid, signal.SIGSTOP)
                     run = LAB.start("box", f"{BUILD}/cli/tavoportmap", "--json", "close", "5001", stdout=-1, text=True,
                                     start_new_session=True)
@@ -347,8 +349,28 @@ class Manual(unittest.TestCase):
             row = {"name": "tavo:x", "protocol": protocol, "first": port, "last": port, "host": BOX, "port": port}
             LAB.run("router", "curl -s -X POST --data-binary @- http://127.0.0.1:8080/upnp", input=json.dumps(row))
         self.assertEqual(self.forwarded(), ["5003/udp", "5001/tcp"])
-        self.assertEqual(LAB.run("box", f"{TOOL} --take-away").returncode, 0)
+        self.assertEqual(LAB.run("box", f"{TOOL} --clear-unused").returncode, 0)
         self.assertEqual(self.forwarded(), ["5001/tcp"])
+
+    def test_who_saves_through_the_library_alone_has_the_pages_cleared(self):
+        """By the daemon, beside it; and not again and again where they refuse."""
+        self.go_over("1,1,tcp,5001,5001", "2,1,udp,5003,5003")
+        LAB.save("1,1,tcp,5001,5001")
+        wait_for(lambda: self.forwarded() == [], 20, "the pages have taken it away")
+        self.assertEqual(self.names(self.told(0, "status")), [])
+        self.go_over("1,1,tcp,5001,5001")
+        good = LAB.read(ACCOUNT)
+        LAB.write(ACCOUNT, good.replace("p&ss", "wrong"))
+        asked = lambda: LAB.web_state()["count"].get("/delete", 0)
+        before = asked()
+        for save in (lambda: LAB.save("1,1,tcp,5002,5002"), lambda: LAB.save("1,1,tcp,5001,5001")):
+            save()
+            wait_for(lambda: asked() > before, 20, "the pages are asked")
+        time.sleep(1)
+        self.assertEqual(asked(), before + 1)
+        self.told(4, "save")
+        time.sleep(1)
+        self.assertEqual(asked(), before + 2, "the tool asks each time, and nobody after it")
 
     def test_what_is_gone_by_the_pages_word_may_be_there_still(self):
         """A change that was not applied, and one more: what is in force has another port of the box than both."""
