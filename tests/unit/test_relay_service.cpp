@@ -100,8 +100,19 @@ bool LockIsFree() {
     return IsLockFree("/tmp/routerconf.lock");
 }
 
-Lines LastLines(size_t nLines) {
-    return {gLog.end() - static_cast<long>(std::min(nLines, gLog.size())), gLog.end()};
+// One after the other.
+template <typename... Steps>
+std::function<void()> All(Steps... fnSteps) {
+    return [=] { (fnSteps(), ...); };
+}
+
+std::function<void()> Settings(const char* szUpnp, const char* szNatpmp) {
+    return [=] { Write(kRouterConf, Conf("R1", szUpnp, szNatpmp)); };
+}
+
+void CacheUnknown() {
+    std::filesystem::remove(kRouterConf);
+    Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n");
 }
 
 class RelayService : public testing::Test {
@@ -153,58 +164,40 @@ TEST_F(RelayService, WhoKeepsAPort) {
     const struct {
         const char* szStored;
         const char* szRequest;
-        const char* szKept;  // null: refused, nothing changes
-        Lines lines;         // what a refusal logs
+        const char* szKept;         // null: refused, nothing changes
+        const char* szPass = "";    // at which it is refused
+        std::string szReason = {};  // and why
     } rgCases[] = {
         // the service's own enabled rules are replaced whole, its name taken to the letter
-        {"E tcp 80 80 hop; E tcp 81 81 Hop", "82/tcp", "1 E tcp 81 81 Hop; 2 E tcp 82 82 hop", {}},
+        {"E tcp 80 80 hop; E tcp 81 81 Hop", "82/tcp", "1 E tcp 81 81 Hop; 2 E tcp 82 82 hop"},
         // its disabled rules keep what it still asks for, and it goes without that
-        {"D tcp 80,443 80,443 hop", "443,8080/tcp", "1 D tcp 443 443 hop; 2 E tcp 8080 8080 hop", {}},
-        {"D tcp 80 80 hop", "80/tcp", "1 D tcp 80 80 hop", {}},
-        {"D tcp 80 80 hop", "81/tcp", "1 E tcp 81 81 hop", {}},
-        {"D tcp 80 80 hop", "80/all", "1 D tcp 80 80 hop; 2 E all 80 80 hop", {}},
+        {"D tcp 80,443 80,443 hop", "443,8080/tcp", "1 D tcp 443 443 hop; 2 E tcp 8080 8080 hop"},
+        {"D tcp 80 80 hop", "80/tcp", "1 D tcp 80 80 hop"},
+        {"D tcp 80 80 hop", "81/tcp", "1 E tcp 81 81 hop"},
+        {"D tcp 80 80 hop", "80/all", "1 D tcp 80 80 hop; 2 E all 80 80 hop"},
         // whoever maps a port already keeps it
-        {"E tcp 80 80", "80/tcp", "1 E tcp 80 80", {}},
-        {"E tcp 81 81", "80-82,80/tcp 81/udp", "1 E tcp 81 81; 2 E tcp 80,82,80 80,82,80 hop; 3 E udp 81 81 hop", {}},
-        {"E tcp 80 80 web W", "80/tcp 81/tcp", "1 E tcp 80 80 web W; 2 E tcp 81 81 hop", {}},
-        {"E all 80 80", "80/tcp 80/udp 80/all", "1 E all 80 80", {}},
-        {"E tcp 80 80", "80/all", "1 E tcp 80 80; 2 E all 80 80 hop", {}},
-        {"D tcp 80 80", "80/tcp", "1 D tcp 80 80; 2 E tcp 80 80 hop", {}},
-        {"E tcp 80-81 90-91", "82-83/tcp", "1 E tcp 80-81 90-91; 2 E tcp 82-83 82-83 hop", {}},
+        {"E tcp 80 80", "80/tcp", "1 E tcp 80 80"},
+        {"E tcp 81 81", "80-82,80/tcp 81/udp", "1 E tcp 81 81; 2 E tcp 80,82,80 80,82,80 hop; 3 E udp 81 81 hop"},
+        {"E tcp 80 80 web W", "80/tcp 81/tcp", "1 E tcp 80 80 web W; 2 E tcp 81 81 hop"},
+        {"E all 80 80", "80/tcp 80/udp 80/all", "1 E all 80 80"},
+        {"E tcp 80 80", "80/all", "1 E tcp 80 80; 2 E all 80 80 hop"},
+        {"D tcp 80 80", "80/tcp", "1 D tcp 80 80; 2 E tcp 80 80 hop"},
+        {"E tcp 80-81 90-91", "82-83/tcp", "1 E tcp 80-81 90-91; 2 E tcp 82-83 82-83 hop"},
         // and so do other hosts, against the service only
-        {"E tcp 5000 5000", "5001/tcp", "1 E tcp 5000 5000; 2 E tcp 5001 5001 hop", {}},
-        {"D tcp 5000 5000 hop", "5000,5002/tcp 5000/all 5000/udp", "1 E tcp 5002 5002 hop; 2 E udp 5000 5000 hop", {}},
+        {"E tcp 5000 5000", "5001/tcp", "1 E tcp 5000 5000; 2 E tcp 5001 5001 hop"},
+        {"D tcp 5000 5000 hop", "5000,5002/tcp 5000/all 5000/udp", "1 E tcp 5002 5002 hop; 2 E udp 5000 5000 hop"},
         // an empty request takes all of the service's rules away; what is left keeps its ports
-        {"E tcp 80 80 hop; E udp 9,10 9,10; D tcp 81 81 hop; D all 5 5 web",
-         "",
-         "1 E udp 9-10 9-10; 2 D all 5 5 web",
-         {}},
-        {"E tcp 80 80 hop", "", "", {}},
-        {"", "82-80/tcp", "1 E tcp 80-82 80-82 hop", {}},
+        {"E tcp 80 80 hop; E udp 9,10 9,10; D tcp 81 81 hop; D all 5 5 web", "", "1 E udp 9-10 9-10; 2 D all 5 5 web"},
+        {"E tcp 80 80 hop", "", ""},
+        {"", "82-80/tcp", "1 E tcp 80-82 80-82 hop"},
         // the first rule that has either port decides
-        {"E tcp 80 80; E tcp 80 81", "80/tcp", "1 E tcp 80 80; 2 E tcp 80 81", {}},
+        {"E tcp 80 80; E tcp 80 81", "80/tcp", "1 E tcp 80 80; 2 E tcp 80 81"},
         // half an overlap decides nothing
-        {"E tcp 80,81 81,80",
-         "80/tcp",
-         nullptr,
-         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
-        {"E tcp 8080 80",
-         "80/tcp",
-         nullptr,
-         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
-        {"E tcp 80 8080",
-         "81/udp 80/tcp",
-         nullptr,
-         {szPartial, "DeletePortsFromRules1(C->A) failed", "DeletePortsFromRuleConf(input rules=2) failed"}},
-        {"D tcp 80 81 hop",
-         "80/tcp",
-         nullptr,
-         {szPartial, "DeletePortsFromRules1(B->C) failed", "DeletePortsFromRuleConf(input rules=1) failed"}},
-        {"D tcp 80,81 80 hop",
-         "80/tcp",
-         nullptr,
-         {"begin, router port numbers=2 != box port numbers=1", "DeletePortsFromRules1(B->C) failed",
-          "DeletePortsFromRuleConf(input rules=1) failed"}},
+        {"E tcp 80,81 81,80", "80/tcp", nullptr, "C->A", szPartial},
+        {"E tcp 8080 80", "80/tcp", nullptr, "C->A", szPartial},
+        {"E tcp 80 8080", "81/udp 80/tcp", nullptr, "C->A", szPartial},
+        {"D tcp 80 81 hop", "80/tcp", nullptr, "B->C", szPartial},
+        {"D tcp 80,81 80 hop", "80/tcp", nullptr, "B->C", "begin, router port numbers=2 != box port numbers=1"},
     };
     for (const auto& c : rgCases) {
         SCOPED_TRACE(std::string(c.szStored) + " <- " + c.szRequest);
@@ -214,7 +207,9 @@ TEST_F(RelayService, WhoKeepsAPort) {
         EXPECT_EQ(Set("hop", rgRequests), c.szKept == nullptr ? -1 : 0);
         if (c.szKept == nullptr) {
             EXPECT_EQ(Read(kRuleConf), Stored(c.szStored));
-            EXPECT_EQ(gLog, c.lines);
+            EXPECT_EQ(gLog,
+                      Lines({c.szReason, std::string("DeletePortsFromRules1(") + c.szPass + ") failed",
+                             "DeletePortsFromRuleConf(input rules=" + std::to_string(rgRequests.size()) + ") failed"}));
             EXPECT_FALSE(std::filesystem::exists(kSystemConf));
         } else {
             EXPECT_EQ(Kept(), c.szKept);
@@ -281,88 +276,45 @@ TEST_F(RelayService, SavesUnderItsLockThenTestsAllThatWasAskedFor) {
     EXPECT_EQ(mClient.rgszCalls, Lines());
 }
 
-struct SetFault {
-    const char* szWhat;
-    std::function<void()> fnSpoil;
-    int nResult;
-    Lines lines;  // the last ones
-    bool blSaved;
-};
-
 TEST_F(RelayService, EachStepThatFails) {
     const std::string szOld = Stored("E tcp 80 80; E tcp 81 81 hop");
+    const std::string szLong = std::string("10000-10001") + std::string(1002, ',') + "12,443,4433";
     Requests rgRequests;
-    static const std::string szLong = std::string("10000-10001") + std::string(1002, ',') + "12,443,4433";
-    const Lines noState = {"cannot get gateway router ip", "get gateway ip failed", "GetInitState() failed"};
-    const SetFault rgFaults[] = {
-        {"lock held",
-         [] { TLibTavoPortMapLock(); },
-         2,
-         {"PortForwarding conflict = /tmp/routerconf.lock, other user is doing portforwarding"},
-         false},
-        {"no gateway", [] { gSzGateway.clear(); }, -1, noState, false},
-        {"never detected",
-         [] { std::filesystem::remove(kRouterConf); },
-         1,
-         {"file=/etc/portforward/router.conf not exists", "Not initialized portforwarding"},
-         false},
-        {"a cache of the unknown",
-         [] {
-             std::filesystem::remove(kRouterConf);
-             Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n");
-         },
-         -1,
-         {"failed, state is unknown"},
-         false},
-        {"a manual router",
-         [] { Write(kRouterConf, Conf("R1", "no", "no")); },
-         -1,
-         {"Can not set rules for manual router"},
-         false},
-        {"a rule of another protocol",
-         [] { Write(kRuleConf, Stored("E TCP 80 80")); },
-         -1,
-         {"Bad parameter, szProtocol=TCP", "ToProtocolEnum([0]=-1) failed",
-          "CreateOperationRulesArray(ruleConf) failed"},
-         false},
-        {"a list that a record would cut",
-         [] { Write(kRuleConf, Stored("E tcp " + szLong + " " + szLong)); },
-         -1,
-         {"TAVOPFRuleGetByIdList() failed", "TLibGetRulesArrFromRuleConf() failed"},
-         false},
-        {"no port asked for",
-         [&] { rgRequests = Ask("0/tcp"); },
-         -1,
-         {"invalid port no [0]", "TLibParsePorts() for routerPort failed", "CreateOperationRulesArray(rgRules) fail"},
-         false},
-        {"a router that is gone",
-         [this] { mNetwork.nUpnpInit = 1; },
-         -1,
-         {"GetUsedRouterPortList() failed", "DeleteConflictPortsForUPnPRouter() failed"},
-         false},
-        {"a gateway that goes",
-         [this] { mHome.fnOnListing = [] { gSzGateway.clear(); }; },
-         -1,
-         {"GetGatewayIP() failed", "get gateway ip failed"},
-         false},
-        {"rule.conf cannot be written",
-         [] { gStage.szFail = "write"; },
-         -1,
-         {"can not sync rules to file", "save rule failed"},
-         false},
-        {"no daemon", [] { gStage.szFail = "exec"; }, -1, {"upnp daemon start failed", "save rule failed"}, true},
-        {"no tester",
-         [this] { mClient.mapAnswers["init"] = -1; },
-         -1,
-         {"TavoPortConnTestInit() failed", "test rule init failed"},
-         true},
-        {"no answer",
-         [this] { mClient.nTester = -1; },
-         -1,
-         {"TavoPortConnTest() failed", "test port connection failed"},
+    const auto fnRule = [](const std::string& szRule) { return [=] { Write(kRuleConf, Stored(szRule)); }; };
+    const auto fnFail = [](const char* szFail) { return [=] { gStage.szFail = szFail; }; };
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnSpoil;
+        int nResult;
+        const char* szLines;  // the last ones
+        bool blSaved = false;
+    } rgFaults[] = {
+        {"lock held", [] { TLibTavoPortMapLock(); }, 2,
+         "PortForwarding conflict = /tmp/routerconf.lock, other user is doing portforwarding"},
+        {"no gateway", [] { gSzGateway.clear(); }, -1,
+         "cannot get gateway router ip\nget gateway ip failed\nGetInitState() failed"},
+        {"never detected", [] { std::filesystem::remove(kRouterConf); }, 1,
+         "file=/etc/portforward/router.conf not exists\nNot initialized portforwarding"},
+        {"a cache of the unknown", CacheUnknown, -1, "failed, state is unknown"},
+        {"a manual router", Settings("no", "no"), -1, "Can not set rules for manual router"},
+        {"a rule of another protocol", fnRule("E TCP 80 80"), -1,
+         "Bad parameter, szProtocol=TCP\nToProtocolEnum([0]=-1) failed\nCreateOperationRulesArray(ruleConf) failed"},
+        {"a list that a record would cut", fnRule("E tcp " + szLong + " " + szLong), -1,
+         "TAVOPFRuleGetByIdList() failed\nTLibGetRulesArrFromRuleConf() failed"},
+        {"no port asked for", [&] { rgRequests = Ask("0/tcp"); }, -1,
+         "invalid port no [0]\nTLibParsePorts() for routerPort failed\nCreateOperationRulesArray(rgRules) fail"},
+        {"a router that is gone", [this] { mNetwork.nUpnpInit = 1; }, -1,
+         "GetUsedRouterPortList() failed\nDeleteConflictPortsForUPnPRouter() failed"},
+        {"a gateway that goes", [this] { mHome.fnOnListing = [] { gSzGateway.clear(); }; }, -1,
+         "GetGatewayIP() failed\nget gateway ip failed"},
+        {"rule.conf cannot be written", fnFail("write"), -1, "can not sync rules to file\nsave rule failed"},
+        {"no daemon", fnFail("exec"), -1, "upnp daemon start failed\nsave rule failed", true},
+        {"no tester", [this] { mClient.mapAnswers["init"] = -1; }, -1,
+         "TavoPortConnTestInit() failed\ntest rule init failed", true},
+        {"no answer", [this] { mClient.nTester = -1; }, -1, "TavoPortConnTest() failed\ntest port connection failed",
          true},
     };
-    for (const SetFault& fault : rgFaults) {
+    for (const auto& fault : rgFaults) {
         SCOPED_TRACE(fault.szWhat);
         SetUp();
         Write(kRuleConf, szOld);
@@ -370,7 +322,7 @@ TEST_F(RelayService, EachStepThatFails) {
         fault.fnSpoil();
         const std::string szBefore = Read(kRuleConf);
         EXPECT_EQ(Set("hop", rgRequests, true), fault.nResult);
-        EXPECT_EQ(LastLines(fault.lines.size()), fault.lines);
+        EXPECT_EQ(LastLines(fault.szLines), fault.szLines);
         if (fault.blSaved) {
             EXPECT_EQ(Kept(), "1 E tcp 80 80; 2 E tcp 82 82 hop");
         } else {
@@ -457,118 +409,57 @@ std::string Known() {
     return szKnown;
 }
 
-struct DetectCase {
-    const char* szWhat;
-    std::function<void()> fnSetUp;
-    int nResult;
-    Lines lines;  // the last ones
-    const char* szKnown;
-};
-
 TEST_F(RelayService, ClassifiesTheRouterOnce) {
     const std::string szDone = "TLibTavoPortMapRouterDetect() success: ";
+    const std::string szManual = szDone + "manual";
+    const std::string szNoDb = "can not read router sdk version\nupgrade db fail";
+    const std::string szNotStored = "TLibSetRouterConf(192.168.1.1) failed";
     const auto fnUnknown = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "New", "2"}; };
-    const auto fnBroken = [&] {
-        fnUnknown();
-        mClient.mapAnswers["modify"] = -1;
-    };
+    const auto fnKnownBad = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Acme", "No", "1.0"}; };
+    const auto fnBroken = [this] { mClient.mapAnswers["modify"] = -1; };
     const auto fnNoSettings = [] { gFnOnConfSet = [] { return -1; }; };
-    const DetectCase rgCases[] = {
-        {"known by its settings",
-         [] { Write(kRouterConf, Conf("R1", "no", "yes")); },
-         0,
-         {szDone + "upnp/natpmp"},
-         "settings no yes;"},
-        {"manual by its settings",
-         [] { Write(kRouterConf, Conf("R1", "no", "no")); },
-         1,
-         {szDone + "manual"},
-         "settings no no;"},
-        {"manual by the cache",
-         [] { SetDetectManualCache("192.168.1.1", "a", "b", "c"); },
-         1,
-         {szDone + "manual"},
-         "manual a/b/c;"},
-        {"an odd cache",
-         [] { Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nbrand=\"a\"\n"); },
-         0,
-         {"can not read router sdk version", "upgrade db fail"},
-         "settings yes no;"},
-        {"a cache of the unknown",
-         [] { Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n"); },
-         -1,
-         {"TLibTavoPortMapRouterDetect() failed, state=0"},
-         ""},
-        {"odd settings",
-         [] { Write(kRouterConf, Conf("R1", "Yes", "no")); },
-         -1,
-         {"GetInitState() failed"},
-         "settings Yes no;"},
-        {"no gateway", [] { gSzGateway.clear(); }, -1, {"cannot get gateway router ip", "get gateway ip failed"}, ""},
-        {"lock held", [] { TLibTavoPortMapLock(); }, 2, {"TLibTavoPortMapRouterDetect() is busy"}, ""},
-        {"UPnP", [] {}, 0, {"can not read router sdk version", "upgrade db fail"}, "settings yes no;"},
-        {"NAT-PMP",
-         [this] {
-             mNetwork.nUpnpInit = 1;
-             mNetwork.szAnnounced = "[192.168.1.1]\nname=\"Den\"\n";
-         },
-         0,
-         {"upgrade db fail", "init UPnP faild"},
-         "settings no yes;"},
-        {"neither", [this] { mNetwork.model.reset(); }, 1, {szDone + "manual"}, "manual //;"},
-        {"UPnP that is known not to work",
-         [this] {
-             mNetwork.model = {{"Acme", "No", "1.0"}};
-         },
-         1,
-         {szDone + "manual"},
-         "manual Acme/No/1.0;"},
-        {"no detection", [this] { mNetwork.nWan = -1; }, -1, {"Can not connect to WAN", "TLibDetectRouter failed"}, ""},
-        {"no settings written", fnNoSettings, -1, {"sync config failed", "TLibSetRouterConf(192.168.1.1) failed"}, ""},
-        {"it works", fnUnknown, 0, {szDone + "(comp) upnp/natpmp"}, "settings yes no;tested yes 10"},
-        {"nobody had tested it",
-         [&] {
-             fnUnknown();
-             Write(kRouterConf, Conf("R1", "unknown", "no"));
-         },
-         0,
-         {szDone + "(comp) upnp/natpmp"},
-         "settings yes no;tested yes 10"},
-        {"it does not work", fnBroken, 1, {szDone + "(comp) manual"}, "manual Acme/New/2;tested no -1"},
-        {"another test runs",
-         [&] {
-             fnUnknown();
-             gStage.alive.insert("/usr/tavo/sbin/upnpd --debug -p");
-         },
-         -1,
-         {"TLibTestUpnpCompatibility() failed"},
-         ""},
-        {"it works, no settings written",
-         [&] {
-             fnUnknown();
-             fnNoSettings();
-         },
-         -1,
-         {"TLibSetRouterConf(192.168.1.1) failed"},
-         "tested yes 10"},
-        {"no record written",
-         [&] {
-             fnUnknown();
-             std::filesystem::create_directories(std::string(kUserDb) + "/x");
-         },
-         -1,
-         {"TLibWriteRecordIntoUpnpDB() failed"},
-         ""},
-        {"no cache written",
-         [&] {
-             fnBroken();
-             std::filesystem::create_directories(SZF_DETECT_MANUAL_CACHE + "/x");
-         },
-         -1,
-         {"Sync() failed", "set detect cache failed"},
-         "tested no -1"},
+    const auto fnCache = [](const char* szPair) {
+        return [=] { Write(SZF_DETECT_MANUAL_CACHE, std::string("[192.168.1.1]\n") + szPair + "\n"); };
     };
-    for (const DetectCase& c : rgCases) {
+    const auto fnInTheWay = [](const std::string& szPath) {
+        return [=] { std::filesystem::create_directories(szPath + "/x"); };
+    };
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnSetUp;
+        int nResult;
+        std::string szLines;  // the last ones
+        const char* szKnown;
+    } rgCases[] = {
+        {"known by its settings", Settings("no", "yes"), 0, szDone + "upnp/natpmp", "settings no yes;"},
+        {"manual by its settings", Settings("no", "no"), 1, szManual, "settings no no;"},
+        {"manual by the cache", [] { SetDetectManualCache("192.168.1.1", "a", "b", "c"); }, 1, szManual,
+         "manual a/b/c;"},
+        {"an odd cache", fnCache("brand=\"a\""), 0, szNoDb, "settings yes no;"},
+        {"a cache of the unknown", CacheUnknown, -1, "TLibTavoPortMapRouterDetect() failed, state=0", ""},
+        {"odd settings", Settings("Yes", "no"), -1, "GetInitState() failed", "settings Yes no;"},
+        {"no gateway", [] { gSzGateway.clear(); }, -1, "cannot get gateway router ip\nget gateway ip failed", ""},
+        {"lock held", [] { TLibTavoPortMapLock(); }, 2, "TLibTavoPortMapRouterDetect() is busy", ""},
+        {"UPnP", [] {}, 0, szNoDb, "settings yes no;"},
+        {"NAT-PMP",
+         All([this] { mNetwork.nUpnpInit = 1; }, [this] { mNetwork.szAnnounced = "[192.168.1.1]\nname=\"Den\"\n"; }), 0,
+         "upgrade db fail\ninit UPnP faild", "settings no yes;"},
+        {"neither", [this] { mNetwork.model.reset(); }, 1, szManual, "manual //;"},
+        {"UPnP that is known not to work", fnKnownBad, 1, szManual, "manual Acme/No/1.0;"},
+        {"no detection", [this] { mNetwork.nWan = -1; }, -1, "Can not connect to WAN\nTLibDetectRouter failed", ""},
+        {"no settings written", fnNoSettings, -1, "sync config failed\n" + szNotStored, ""},
+        {"it works", fnUnknown, 0, szDone + "(comp) upnp/natpmp", "settings yes no;tested yes 10"},
+        {"nobody had tested it", All(fnUnknown, Settings("unknown", "no")), 0, szDone + "(comp) upnp/natpmp",
+         "settings yes no;tested yes 10"},
+        {"it does not work", All(fnUnknown, fnBroken), 1, szDone + "(comp) manual", "manual Acme/New/2;tested no -1"},
+        {"another test runs", All(fnUnknown, [] { gStage.alive.insert("/usr/tavo/sbin/upnpd --debug -p"); }), -1,
+         "TLibTestUpnpCompatibility() failed", ""},
+        {"it works, no settings written", All(fnUnknown, fnNoSettings), -1, szNotStored, "tested yes 10"},
+        {"no record written", All(fnUnknown, fnInTheWay(kUserDb)), -1, "TLibWriteRecordIntoUpnpDB() failed", ""},
+        {"no cache written", All(fnUnknown, fnBroken, fnInTheWay(SZF_DETECT_MANUAL_CACHE)), -1,
+         "Sync() failed\nset detect cache failed", "tested no -1"},
+    };
+    for (const auto& c : rgCases) {
         SCOPED_TRACE(c.szWhat);
         TearDown();
         SetUp();
@@ -578,7 +469,7 @@ TEST_F(RelayService, ClassifiesTheRouterOnce) {
         const int nResult = TLibTavoPortMapRouterDetect();
         EXPECT_EQ(nResult, c.nResult);
         std::erase_if(gLog, [](const std::string& szLine) { return szLine.starts_with("> "); });
-        EXPECT_EQ(LastLines(c.lines.size()), c.lines);
+        EXPECT_EQ(LastLines(c.szLines), c.szLines);
         EXPECT_EQ(Known(), c.szKnown);
         EXPECT_EQ(LockIsFree(), nResult != 2);
         if (nResult == 2) {

@@ -103,6 +103,16 @@ inline bool LoggedFrom(const std::string& szBegin) {
     return std::any_of(gLog.begin(), gLog.end(), [&](const auto& szSeen) { return szSeen.starts_with(szBegin); });
 }
 
+// As many of the last lines as the other text has, joined as there.
+inline std::string LastLines(const std::string& szLike) {
+    const auto nLines = static_cast<size_t>(std::count(szLike.begin(), szLike.end(), '\n')) + 1;
+    std::string szLast;
+    for (size_t i = gLog.size() - std::min(nLines, gLog.size()); i < gLog.size(); ++i) {
+        szLast += (szLast.empty() ? "" : "\n") + gLog[i];
+    }
+    return szLast;
+}
+
 // Whether another process could take the lock now.
 inline bool IsLockFree(const char* szPath) {
     int fd = -1;
