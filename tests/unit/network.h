@@ -3,8 +3,6 @@
 // (the test client); while the pointer to one of these is null, the real platform answers.
 #pragma once
 
-#include <dlfcn.h>
-
 #include <functional>
 #include <map>
 #include <optional>
@@ -66,9 +64,3 @@ struct TestClient {
     }
 };
 extern TestClient* gPClient;
-
-// The platform's own function behind a stand-in.
-template <typename Function>
-Function* Real(const char* szName, Function*) {
-    return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, szName));
-}

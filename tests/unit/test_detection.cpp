@@ -31,10 +31,7 @@ constexpr char kAnnounced[] = "/tmp/airport.tcp.local";
 class Detection : public testing::Test {
 protected:
     void SetUp() override {
-        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/bin"}) {
-            std::filesystem::remove_all(szDir);
-            std::filesystem::create_directories(szDir);
-        }
+        MakeEmpty({"/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/bin"});
         std::filesystem::remove_all("/var/lib/tavo/tasks");
         for (const char* szFile : {"/etc/tavoinfo.conf", kAnnounced}) {
             std::filesystem::remove(szFile);
@@ -55,10 +52,7 @@ protected:
         gFnOnConfSet = nullptr;
         gStage = {};
     }
-    static void SetTool(const std::string& szLine) {
-        Write(kTool, "#!/bin/sh\necho '" + szLine + "'\n");
-        chmod(kTool, 0755);
-    }
+    static void SetTool(const std::string& szLine) { WriteProgram(kTool, "echo '" + szLine + "'\n"); }
     Network mNetwork;
 };
 
@@ -142,20 +136,18 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
 
 // ---- the detectors ---------------------------------------------------------------------------------------
 
-struct UpnpCase {
-    const char* szWhat;
-    int nInit;
-    std::optional<TAVO_UPNP_GATEWAY_MODEL> model;
-    bool blResult;
-    const char* szSupport;
-    const char* szPfPath;
-    int nUpdates;
-    const char* szLine;
-};
-
 TEST_F(Detection, UpnpVerdicts) {
     std::filesystem::create_directories("/etc.defaults/portforward/routerdb/x");
-    const UpnpCase rgCases[] = {
+    const struct {
+        const char* szWhat;
+        int nInit;
+        std::optional<TAVO_UPNP_GATEWAY_MODEL> model;
+        bool blResult;
+        const char* szSupport;
+        const char* szPfPath;
+        int nUpdates;
+        const char* szLine;
+    } rgCases[] = {
         {"known model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"}, true, "yes", "Acme: R1(1.0)", 0, ""},
         {"no router", 1, {}, true, "no", "", 0, "init UPnP faild"},
         {"no model", 0, {}, true, "no", "", 0, ""},
@@ -166,7 +158,7 @@ TEST_F(Detection, UpnpVerdicts) {
          "pfPath does not exist"},
     };
     Write("/etc.defaults/etc/x/router.des", "");
-    for (const UpnpCase& upnpCase : rgCases) {
+    for (const auto& upnpCase : rgCases) {
         SCOPED_TRACE(upnpCase.szWhat);
         mNetwork = Network();
         mNetwork.nUpnpInit = upnpCase.nInit;
@@ -217,18 +209,16 @@ TEST_F(Detection, MissingDescriptionIsFetchedOnceAndALockedDetectionChangesNothi
     unlock_file(fd);
 }
 
-struct AirPortCase {
-    const char* szWhat;
-    int nCreated;  // poll before which the file appears; 0: never
-    int nGone;     // poll before which it vanishes
-    const char* szText;
-    const char* szSupport;
-    const char* szName;
-    int nSleeps;
-};
-
 TEST_F(Detection, AirPortPolls) {
-    const AirPortCase rgCases[] = {
+    const struct {
+        const char* szWhat;
+        int nCreated;  // poll before which the file appears; 0: never
+        int nGone;     // poll before which it vanishes
+        const char* szText;
+        const char* szSupport;
+        const char* szName;
+        int nSleeps;
+    } rgCases[] = {
         {"seen in poll 3, confirmed in 4", 3, 0, "[192.168.1.1]\nname=Den\n", "yes", "Den", 3},
         {"first seen in the last poll", 6, 0, "[192.168.1.1]\nname=Den\n", "yes", "Den", 6},
         {"never there", 0, 0, "", "no", "", 6},
@@ -237,7 +227,7 @@ TEST_F(Detection, AirPortPolls) {
         {"no name", 1, 0, "[192.168.1.1]\nkind=x\n", "yes", "", 1},
         {"no list", 1, 0, "garbage\n", "no", "", 1},
     };
-    for (const AirPortCase& airPort : rgCases) {
+    for (const auto& airPort : rgCases) {
         SCOPED_TRACE(airPort.szWhat);
         Write(kAnnounced, "[192.168.1.1]\nname=stale\n");
         std::filesystem::remove("/etc/tavoinfo.conf");
@@ -329,70 +319,50 @@ TEST_F(Detection, AResultThatCannotBeStoredIsNoSuccess) {
 
 // ---- the driver ------------------------------------------------------------------------------------------
 
-struct DriverCase {
-    const char* szWhat;
-    std::function<void(Network&)> fnChange;
-    std::vector<int> rgProgress;
-    int nResult;
-    int nErr;
-    int nFlags;
-    int nMaxRule;
-    const char* szLine;
-};
-
 void NoteProgress(const DetectResult* pResult, void* pData) {
     static_cast<std::vector<int>*>(pData)->push_back(pResult == nullptr ? -1 : pResult->nProgress);
 }
 
 TEST_F(Detection, DriverInEachNetwork) {
-    const std::vector<int> rgWhole = {10, 20, 30, 40, 70, 50, 80, 80};
-    const DriverCase rgCases[] = {
-        {"all is well", [](Network&) {}, rgWhole, 0, 0, 0, 32, "All network env checks are pass"},
-        {"no interface",
-         [](Network& net) { net.nInterface = -1; },
-         {10, 20, 20},
-         -1,
-         0,
-         0,
-         0,
-         "Network interface is not enabled"},
-        {"no WAN", [](Network& net) { net.nWan = -1; }, {10, 20, 30, 40, 40}, -1, 3, 0, 0, "Can not connect to WAN"},
-        {"no DNS",
-         [](Network& net) { net.nDns = -1; },
-         {10, 20, 30, 40, 70, 50, 50},
-         -1,
-         4,
-         0,
-         0,
-         "DNS setting may be not correct"},
-        {"odd gateway and two routers",
-         [](Network& net) {
-             net.nGateway = -1;
-             net.nLevel = 2;
-         },
-         rgWhole, 0, 0, 1 | 4, 32, "nPublicIPLevel=2 > 1, can not do portforwarding"},
-        {"level unknown", [](Network& net) { net.nLevel.reset(); }, rgWhole, 0, 0, 2, 32,
-         "Unable to get public ip level"},
-        {"neither protocol", [](Network& net) { net.nUpnpInit = 1; }, rgWhole, 0, 0, 0, -1, "upgrade db fail"},
-        {"no process", [](Network& net) { net.blForkFails = true; }, rgWhole, -1, 0, 0, 0,
+    const auto fnBadModel = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}; };
+    const std::vector<int> rgAll = {10, 20, 30, 40, 70, 50, 80, 80};
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnChange;
+        size_t nSteps;  // of those; where it ends before, the last one is told twice
+        int nResult;
+        int nErr;
+        int nFlags;
+        int nMaxRule;
+        const char* szLine;
+    } rgCases[] = {
+        {"all is well", [] {}, 8, 0, 0, 0, 32, "All network env checks are pass"},
+        {"no interface", [this] { mNetwork.nInterface = -1; }, 2, -1, 0, 0, 0, "Network interface is not enabled"},
+        {"no WAN", [this] { mNetwork.nWan = -1; }, 4, -1, 3, 0, 0, "Can not connect to WAN"},
+        {"no DNS", [this] { mNetwork.nDns = -1; }, 6, -1, 4, 0, 0, "DNS setting may be not correct"},
+        {"odd gateway and two routers", [this] { mNetwork.nGateway = -1, mNetwork.nLevel = 2; }, 8, 0, 0, 1 | 4, 32,
+         "nPublicIPLevel=2 > 1, can not do portforwarding"},
+        {"level unknown", [this] { mNetwork.nLevel.reset(); }, 8, 0, 0, 2, 32, "Unable to get public ip level"},
+        {"neither protocol", [this] { mNetwork.nUpnpInit = 1; }, 8, 0, 0, 0, -1, "upgrade db fail"},
+        {"no process", [this] { mNetwork.blForkFails = true; }, 8, -1, 0, 0, 0,
          "upnp fork error, errno=Resource temporarily unavailable"},
-        {"supported, but nobody knows its maximum",
-         [](Network& net) {
-             net.model = TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"};
-         },
-         rgWhole, -1, 0, 0, 0, "fillRouterDetectResult failed"},
+        {"supported, but nobody knows its maximum", fnBadModel, 8, -1, 0, 0, 0, "fillRouterDetectResult failed"},
     };
-    for (const DriverCase& driver : rgCases) {
+    for (const auto& driver : rgCases) {
         SCOPED_TRACE(driver.szWhat);
         mNetwork = Network();
-        driver.fnChange(mNetwork);
+        driver.fnChange();
         gLog.clear();
         ASSERT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1);
         DetectResult result = {};
         std::vector<int> rgProgress;
+        std::vector<int> rgWanted(rgAll.begin(), rgAll.begin() + static_cast<std::ptrdiff_t>(driver.nSteps));
+        if (driver.nSteps < rgAll.size()) {
+            rgWanted.push_back(rgWanted.back());
+        }
         EXPECT_EQ(TLibDetectRouter(&result, &NoteProgress, &rgProgress, true), driver.nResult);
-        EXPECT_EQ(rgProgress, driver.rgProgress);
-        EXPECT_EQ(result.nProgress, driver.nResult == 0 ? 100 : driver.rgProgress.back());
+        EXPECT_EQ(rgProgress, rgWanted);
+        EXPECT_EQ(result.nProgress, driver.nResult == 0 ? 100 : rgWanted.back());
         EXPECT_EQ(result.errCode, driver.nErr);
         EXPECT_EQ(result.nEnvFlags, driver.nFlags);
         EXPECT_EQ(result.nMaxRule, driver.nMaxRule);
@@ -459,9 +429,7 @@ TEST_F(Detection, ChildWithoutGatewayReturnsAndLeavesTheLockToItsParent) {
     std::filesystem::remove("/tmp/child_progress");
     bool blLockedAfterChild = false;
     mNetwork.fnInit = [&] {
-        for (int i = 0; i < 500 && !std::filesystem::exists("/tmp/child_done"); ++i) {
-            usleep(10000);
-        }
+        SoonTrue([] { return std::filesystem::exists("/tmp/child_done"); });
         blLockedAfterChild = !IsLockFree("/tmp/routerconf.lock");
     };
     std::filesystem::remove("/tmp/child_done");
@@ -504,20 +472,7 @@ TEST_F(Detection, CallerWithChildrenOfItsOwnAndOneThatIgnoresTheirEnds) {
 // ---- the router's settings -------------------------------------------------------------------------------
 
 RouterConf MakeConf(const char* szUpnp, const char* szNatpmp) {
-    RouterConf conf = {};
-    const auto fnFill = [](char(&szField)[1024], const char* szText) {
-        snprintf(szField, sizeof(szField), "%s", szText);
-    };
-    fnFill(conf.szBrand, "Acme");
-    fnFill(conf.szModel, "R1");
-    fnFill(conf.szVersion, "1.0");
-    fnFill(conf.szSupportUpnp, szUpnp);
-    fnFill(conf.szSupportNatpmp, szNatpmp);
-    fnFill(conf.szUser, "admin");
-    fnFill(conf.szPass, "p\"w");
-    fnFill(conf.szConnType, "http");
-    fnFill(conf.szConnPort, "80");
-    return conf;
+    return *NewSettings(szUpnp, szNatpmp, "admin", "p\"w");
 }
 
 TEST_F(Detection, SettingsRoundTrip) {
@@ -553,51 +508,39 @@ TEST_F(Detection, SettingsRoundTrip) {
     EXPECT_FALSE(std::filesystem::exists(kRouterConf));
 }
 
-struct StoreFault {
-    const char* szWhat;
-    std::function<void(RouterConf&)> fnBreak;
-    const char* szLine;
-    bool blKept;  // the old file is there afterwards
-    int nErr;
-};
-
 TEST_F(Detection, SettingsAfterEachFault) {
     const std::string szOld = "[192.168.1.1]\nbrand=old\n";
-    const auto fnUpnp = [](RouterConf& conf) { snprintf(conf.szSupportUpnp, 1024, "yes"); };
-    const StoreFault rgFaults[] = {
-        {"no support word", [](RouterConf& conf) { conf.szSupportNatpmp[0] = '\0'; },
-         "support_natpmp shall not be empty", true, 1},
-        {"no connection type", [](RouterConf& conf) { conf.szConnType[0] = '\0'; }, "conntype shall not be empty", true,
-         1},
-        {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty", true, 1},
-        {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed", true, 1},
-        {"a type that cannot be kept", [](RouterConf&) { gStage.blOn = true, gStage.szFail = "conn_type"; },
-         "save config failed", true, 1},
-        {"a port that cannot be kept", [](RouterConf&) { gStage.blOn = true, gStage.szFail = "conn_port"; },
-         "save config failed", true, 1},
-        {"a word of UPnP that cannot be kept",
-         [](RouterConf&) { gStage.blOn = true, gStage.szFail = "support_router_upnp"; }, "save support upnp failed",
-         true, 1},
-        {"a word of NAT-PMP that cannot be kept",
-         [](RouterConf&) { gStage.blOn = true, gStage.szFail = "support_router_natpmp"; }, "save support natpmp failed",
-         true, 1},
-        {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
-         "can not save backup file of '/etc/portforward/router.conf.bak'", true, 1},
-        {"failed write", [](RouterConf&) { gFnOnConfSet = [] { return -1; }; }, "sync config failed", true, 1},
-        {"no description", [](RouterConf&) { std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme"); },
-         "can not get router syntax version", true, 1},
-        {"old tool", [](RouterConf&) { SetTool("syntax version=0"); },
-         "syntax version and routerdb version is mis-mtached", true, 6},
-        {"UPnP router, failed write",
-         [&](RouterConf& conf) {
-             fnUpnp(conf);
-             gFnOnConfSet = [] { return -1; };
-         },
-         "sync config failed", false, 1},
-        {"lock held", [](RouterConf&) { TLibTavoPortMapLock(); }, "PortForward conflict = /tmp/routerconf.lock", true,
-         2},
+    const auto fnFail = [](const char* szFail) {
+        return [=](RouterConf&) { gStage.blOn = true, gStage.szFail = szFail; };
     };
-    for (const StoreFault& fault : rgFaults) {
+    const auto fnNoWrite = [](RouterConf&) { gFnOnConfSet = [] { return -1; }; };
+    const auto fnNoUpnpWrite = [&](RouterConf& conf) { conf = MakeConf("yes", "no"), fnNoWrite(conf); };
+    const struct {
+        const char* szWhat;
+        std::function<void(RouterConf&)> fnBreak;
+        const char* szLine;
+        int nErr = 1;
+    } rgFaults[] = {
+        {"no support word", [](RouterConf& conf) { conf.szSupportNatpmp[0] = '\0'; },
+         "support_natpmp shall not be empty"},
+        {"no connection type", [](RouterConf& conf) { conf.szConnType[0] = '\0'; }, "conntype shall not be empty"},
+        {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty"},
+        {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed"},
+        {"a type that cannot be kept", fnFail("conn_type"), "save config failed"},
+        {"a port that cannot be kept", fnFail("conn_port"), "save config failed"},
+        {"a word of UPnP that cannot be kept", fnFail("support_router_upnp"), "save support upnp failed"},
+        {"a word of NAT-PMP that cannot be kept", fnFail("support_router_natpmp"), "save support natpmp failed"},
+        {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
+         "can not save backup file of '/etc/portforward/router.conf.bak'"},
+        {"failed write", fnNoWrite, "sync config failed"},
+        {"no description", [](RouterConf&) { std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme"); },
+         "can not get router syntax version"},
+        {"old tool", [](RouterConf&) { SetTool("syntax version=0"); },
+         "syntax version and routerdb version is mis-mtached", 6},
+        {"UPnP router, failed write", fnNoUpnpWrite, "sync config failed"},
+        {"lock held", [](RouterConf&) { TLibTavoPortMapLock(); }, "PortForward conflict = /tmp/routerconf.lock", 2},
+    };
+    for (const auto& fault : rgFaults) {
         SCOPED_TRACE(fault.szWhat);
         SetUp();
         Write(kRouterConf, szOld);
@@ -607,7 +550,7 @@ TEST_F(Detection, SettingsAfterEachFault) {
         EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, &enErr, true), -1);
         EXPECT_TRUE(Logged(fault.szLine));
         EXPECT_EQ(Logged("can not get gateway ip"), gSzGateway.empty());
-        EXPECT_EQ(Read(kRouterConf), fault.blKept ? szOld : "");
+        EXPECT_EQ(Read(kRouterConf), *conf.szSupportUpnp == 'y' ? "" : szOld);
         EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
         EXPECT_EQ(enErr, fault.nErr);
         EXPECT_TRUE(gSzFailRename.empty());

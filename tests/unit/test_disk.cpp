@@ -1,7 +1,6 @@
 // The recorder behind disk.h: stand-ins for the C library's calls that change files.
 #include "disk.h"
 
-#include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -33,11 +32,6 @@ constexpr int kMostStates = 20000;  // of one writer: more, and the model or the
 thread_local bool gBlOwn = false;  // the recorder's own doing
 Disk* gPRecording = nullptr;
 std::map<uint64_t, ino_t> gMapInodes;  // of a state that was built: the numbers that the files had when written
-
-template <typename Function>
-Function* Next(Function* /*fnHere*/, const char* szName) {
-    return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, szName));
-}
 
 class Own {
 public:
@@ -475,7 +469,7 @@ int open(const char* szPath, int nFlags, ...) {
     va_start(args, nFlags);
     const mode_t nMode = (nFlags & (O_CREAT | O_TMPFILE)) != 0 ? va_arg(args, mode_t) : 0;
     va_end(args);
-    static const auto fnReal = Next(&open, "open");
+    static const auto fnReal = Real("open", &open);
     return Told(fnReal(szPath, nFlags, nMode), [&] {
         if ((nFlags & O_CREAT) != 0) {
             Recorder::Made(szPath);
@@ -487,34 +481,34 @@ int open(const char* szPath, int nFlags, ...) {
 }
 
 ssize_t write(int fd, const void* pData, size_t nSize) {
-    static const auto fnReal = Next(&write, "write");
+    static const auto fnReal = Real("write", &write);
     const ssize_t nWritten = fnReal(fd, pData, nSize);
     Told(nWritten < 0 ? -1 : 0, [&] { Recorder::Changed(PathOf(fd), "write"); });
     return nWritten;
 }
 
 int ftruncate(int fd, off_t nSize) noexcept {
-    static const auto fnReal = Next(&ftruncate, "ftruncate");
+    static const auto fnReal = Real("ftruncate", &ftruncate);
     return Told(fnReal(fd, nSize), [&] { Recorder::Changed(PathOf(fd), "truncate"); });
 }
 
 int fchmod(int fd, mode_t nMode) noexcept {
-    static const auto fnReal = Next(&fchmod, "fchmod");
+    static const auto fnReal = Real("fchmod", &fchmod);
     return Told(fnReal(fd, nMode), [&] { Recorder::Changed(PathOf(fd), "chmod"); });
 }
 
 int chmod(const char* szPath, mode_t nMode) noexcept {
-    static const auto fnReal = Next(&chmod, "chmod");
+    static const auto fnReal = Real("chmod", &chmod);
     return Told(fnReal(szPath, nMode), [&] { Recorder::Changed(szPath, "chmod"); });
 }
 
 int fchown(int fd, uid_t nUser, gid_t nGroup) noexcept {
-    static const auto fnReal = Next(&fchown, "fchown");
+    static const auto fnReal = Real("fchown", &fchown);
     return Told(fnReal(fd, nUser, nGroup), [&] { Recorder::Changed(PathOf(fd), "chown"); });
 }
 
 int chown(const char* szPath, uid_t nUser, gid_t nGroup) noexcept {
-    static const auto fnReal = Next(&chown, "chown");
+    static const auto fnReal = Real("chown", &chown);
     return Told(fnReal(szPath, nUser, nGroup), [&] { Recorder::Changed(szPath, "chown"); });
 }
 
@@ -524,38 +518,38 @@ int fsync(int fd) {
         errno = EIO;
         return -1;
     }
-    static const auto fnReal = Next(&fsync, "fsync");
+    static const auto fnReal = Real("fsync", &fsync);
     return Told(fnReal(fd), [&] { Recorder::Flushed(fd, false); });
 }
 
 int fdatasync(int fd) {
-    static const auto fnReal = Next(&fdatasync, "fdatasync");
+    static const auto fnReal = Real("fdatasync", &fdatasync);
     return Told(fnReal(fd), [&] { Recorder::Flushed(fd, false); });
 }
 
 int syncfs(int fd) noexcept {
-    static const auto fnReal = Next(&syncfs, "syncfs");
+    static const auto fnReal = Real("syncfs", &syncfs);
     return Told(fnReal(fd), [&] { Recorder::Flushed(fd, true); });
 }
 
 int unlink(const char* szPath) noexcept {
     ChangeName();
-    static const auto fnReal = Next(&unlink, "unlink");
+    static const auto fnReal = Real("unlink", &unlink);
     return Told(fnReal(szPath), [&] { Recorder::Names("unlink", {szPath}); });
 }
 
 int remove(const char* szPath) noexcept {
-    static const auto fnReal = Next(&remove, "remove");
+    static const auto fnReal = Real("remove", &remove);
     return Told(fnReal(szPath), [&] { Recorder::Names("unlink", {szPath}); });
 }
 
 int rmdir(const char* szPath) noexcept {
-    static const auto fnReal = Next(&rmdir, "rmdir");
+    static const auto fnReal = Real("rmdir", &rmdir);
     return Told(fnReal(szPath), [&] { Recorder::Names("rmdir", {szPath}); });
 }
 
 int unlinkat(int fdDir, const char* szPath, int nFlags) noexcept {
-    static const auto fnReal = Next(&unlinkat, "unlinkat");
+    static const auto fnReal = Real("unlinkat", &unlinkat);
     return Told(fnReal(fdDir, szPath, nFlags), [&] { Recorder::Names("unlink", {At(fdDir, szPath)}); });
 }
 
@@ -565,7 +559,7 @@ int rename(const char* szFrom, const char* szTo) noexcept {
         gSzFailRename.clear();
         return -1;
     }
-    static const auto fnReal = Next(&rename, "rename");
+    static const auto fnReal = Real("rename", &rename);
     return Told(fnReal(szFrom, szTo), [&] { Recorder::Names("rename", {szFrom, szTo}); });
 }
 
@@ -579,43 +573,43 @@ int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsign
         errno = EINVAL;
         return -1;
     }
-    static const auto fnReal = Next(&renameat2, "renameat2");
+    static const auto fnReal = Real("renameat2", &renameat2);
     return Told(fnReal(fdFrom, szFrom, fdTo, szTo, nFlags), [&] {
         Recorder::Names("rename", {At(fdFrom, szFrom), At(fdTo, szTo)});
     });
 }
 
 int link(const char* szFrom, const char* szTo) noexcept {
-    static const auto fnReal = Next(&link, "link");
+    static const auto fnReal = Real("link", &link);
     return Told(fnReal(szFrom, szTo), [&] { Recorder::Names("link", {szTo}); });
 }
 
 int symlink(const char* szTarget, const char* szPath) noexcept {
-    static const auto fnReal = Next(&symlink, "symlink");
+    static const auto fnReal = Real("symlink", &symlink);
     return Told(fnReal(szTarget, szPath), [&] { Recorder::Made(szPath); });
 }
 
 int mkdir(const char* szPath, mode_t nMode) noexcept {
-    static const auto fnReal = Next(&mkdir, "mkdir");
+    static const auto fnReal = Real("mkdir", &mkdir);
     return Told(fnReal(szPath, nMode), [&] { Recorder::Made(szPath); });
 }
 
 char* mkdtemp(char* szPath) noexcept {
-    static const auto fnReal = Next(&mkdtemp, "mkdtemp");
+    static const auto fnReal = Real("mkdtemp", &mkdtemp);
     char* szMade = fnReal(szPath);
     Told(szMade == nullptr ? -1 : 0, [&] { Recorder::Made(szPath); });
     return szMade;
 }
 
 int stat(const char* szPath, struct stat* pStatus) noexcept {
-    static const auto fnReal = Next(static_cast<int (*)(const char*, struct stat*)>(&stat), "stat");
+    static const auto fnReal = Real("stat", static_cast<int (*)(const char*, struct stat*)>(&stat));
     const int nResult = fnReal(szPath, pStatus);
     Pretend(pStatus);
     return nResult;
 }
 
 int fstat(int fd, struct stat* pStatus) noexcept {
-    static const auto fnReal = Next(&fstat, "fstat");
+    static const auto fnReal = Real("fstat", &fstat);
     const int nResult = fnReal(fd, pStatus);
     std::error_code error;
     if (!gSzForeign.empty() && fs::read_symlink(PathOf(fd), error) == gSzForeign) {

@@ -202,71 +202,59 @@ TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
 
 using RouterConf = __tag_TAVO_ROUTER_CONF;
 
-// What a call does to the settings, wherever in it the process is killed.
-struct KilledCall {
-    const char* szWhat;
-    const char* szSupport;  // of the new settings; null: a report instead
-    int nToolVersion;
-    bool blMayBeNew;
-};
-
 constexpr char kOldSettings[] =
     "[192.168.1.1]\nbrand=Old\nsupport_router_upnp=no\nsupport_router_natpmp=no\nuser=me\npass=secret\n";
 
-void CallAndDie(const KilledCall& call) {
-    if (call.szSupport == nullptr) {
-        Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
-              R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
-                  "able_get_brand_model_version":"yes"})");
-        gStage.blOn = true;
-        gStage.fnRun = [](const std::string& szCommand) {
-            rename("/nowhere", "/nowhere");  // one more place to die at
-            const auto pConf = std::make_unique<RouterConf>();
-            const bool blPacking = szCommand.starts_with("/bin/tar");
-            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false), 0);
-            EXPECT_STREQ(pConf->szBrand, blPacking ? "Acme" : "Old");
-            EXPECT_STREQ(pConf->szPass, blPacking ? "" : "secret");
-            if (blPacking) {
-                const size_t nName = szCommand.find('\'') + 1;
-                Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
-            }
-        };
-        TLibUploadTestUpnpCompatibilityFailResult();
-        return;
-    }
-    const auto pConf = std::make_unique<RouterConf>();
-    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"},
-                                           {pConf->szModel, "R1"},
-                                           {pConf->szVersion, "1.0"},
-                                           {pConf->szSupportUpnp, call.szSupport},
-                                           {pConf->szSupportNatpmp, "no"},
-                                           {pConf->szUser, "new"},
-                                           {pConf->szConnType, "http"},
-                                           {pConf->szConnPort, "80"}}) {
-        snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
-    }
-    TLibSetRouterConf("192.168.1.1", pConf.get(), nullptr, true);
+void SetSettings(const char* szUpnp) {
+    TLibSetRouterConf("192.168.1.1", NewSettings(szUpnp, "no", "new", "").get(), nullptr, true);
 }
 
-TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
-    const KilledCall rgCalls[] = {{"a UPnP router", "yes", 1, true},
-                                  {"a router of pages", "no", 1, true},
-                                  {"one whose settings cannot be used", "no", 0, true},
-                                  {"a report", nullptr, 1, false}};
-    constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
+void SendReport() {
+    Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
+          R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
+              "able_get_brand_model_version":"yes"})");
+    gStage.blOn = true;
+    gStage.fnRun = [](const std::string& szCommand) {
+        rename("/nowhere", "/nowhere");  // one more place to die at
+        const auto pConf = std::make_unique<RouterConf>();
+        const bool blPacking = szCommand.starts_with("/bin/tar");
+        EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false), 0);
+        EXPECT_STREQ(pConf->szBrand, blPacking ? "Acme" : "Old");
+        EXPECT_STREQ(pConf->szPass, blPacking ? "" : "secret");
+        PackNothing(szCommand);
+    };
+    TLibUploadTestUpnpCompatibilityFailResult();
+}
+
+// The router is known, and the tool that carries out its pages is there.
+void KnowTheRouter(int nToolVersion = 1) {
+    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
     Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-    for (const KilledCall& call : rgCalls) {
-        Write(kTool, "#!/bin/sh\necho 'syntax version=" + std::to_string(call.nToolVersion) + "'\n");
-        chmod(kTool, 0755);
+    WriteProgram("/usr/tavo/bin/tavoportforward", "echo 'syntax version=" + std::to_string(nToolVersion) + "'\n");
+}
+
+// What a call does to the settings, wherever in it the process is killed.
+TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
+    const auto fnSet = [](const char* szUpnp) { return [=] { SetSettings(szUpnp); }; };
+    const struct {
+        const char* szWhat;
+        std::function<void()> fnCall;
+        int nToolVersion = 1;
+        bool blMayBeNew = true;
+    } rgCalls[] = {{"a UPnP router", fnSet("yes")},
+                   {"a router of pages", fnSet("no")},
+                   {"one whose settings cannot be used", fnSet("no"), 0},
+                   {"a report", SendReport, 1, false}};
+    for (const auto& call : rgCalls) {
         int nKilled = 0;
         for (bool blKilled = true; blKilled && nKilled < 100; nKilled += blKilled ? 1 : 0) {
             SetUp();
-            Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
+            KnowTheRouter(call.nToolVersion);
             Write(kRouterConf, kOldSettings);
             const pid_t pid = fork();
             if (pid == 0) {
                 gNGoodChanges = nKilled;
-                CallAndDie(call);
+                call.fnCall();
                 _exit(0);
             }
             int nStatus = 0;
@@ -302,13 +290,13 @@ TEST_F(Faults, ReadersLeaveToALiveWriterWhatItSetAside) {
             TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, false);
             return -1;
         };
-        CallAndDie({"", szSupport, 1, true});
+        SetSettings(szSupport);
         // A failed write of a UPnP router ends with no settings, but for those that one before had left as ".bak".
         EXPECT_EQ(Read(kRouterConf), *szSupport == 'n' || szFile == szKilled ? kOldSettings : "");
     }
     Write(kRouterConf, kOldSettings);
     gFnOnConfSet = nullptr;
-    CallAndDie({"", nullptr, 1, false});
+    SendReport();
     EXPECT_EQ(Read(kRouterConf), kOldSettings);
 }
 
@@ -319,7 +307,7 @@ TEST_F(Faults, AStoreThatFailsLeavesWhatAKilledWriterLeft) {
         for (const char* szSuffix : {"aB3dE6", ".bak"}) {
             std::filesystem::remove(kRouterConf);
             Write(std::string(kRouterConf) + szSuffix, kOldSettings);
-            CallAndDie({"", szSupport, 1, true});
+            SetSettings(szSupport);
             const auto pConf = std::make_unique<RouterConf>();
             EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), 0) << szSupport << szSuffix;
             EXPECT_EQ(Read(kRouterConf), kOldSettings) << szSupport << szSuffix;
@@ -342,10 +330,7 @@ TEST_F(Faults, RulesComeBackWhoeverHasThemLocked) {
 // Whoever may read the settings may lock them too: he is in the way of nobody who stores or reports. Who may write them
 // can: what cannot be held could be brought back too soon, and be packed with the password in it.
 TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
-    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
-    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=0'\n");
-    chmod("/usr/tavo/bin/tavoportforward", 0755);
+    KnowTheRouter(0);
     for (const char* szLock : {"flock", "read", "write"}) {
         gLog.clear();
         Write(kRouterConf, kOldSettings);
@@ -356,9 +341,9 @@ TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
         ASSERT_EQ(std::string(szLock) == "flock" ? flock(fdForeign.Get(), LOCK_EX)
                                                  : fcntl(fdForeign.Get(), F_OFD_SETLK, &lock),
                   0);
-        CallAndDie({"", nullptr, 1, false});
+        SendReport();
         EXPECT_EQ(LoggedFrom("> run /bin/tar"), !blWrite) << szLock;
-        CallAndDie({"settings of a newer syntax are undone", "no", 0, false});
+        SetSettings("no");  // of a newer syntax: they are undone
         EXPECT_EQ(Read(kRouterConf), kOldSettings) << szLock;
         EXPECT_EQ(Names(), (Lines{"router.conf", "router_upnp.db"})) << szLock;
     }
@@ -397,43 +382,37 @@ TEST_F(Faults, WhatAReportSetAsideComesBackUnlessSomebodyHasWrittenSince) {
 
 // The same answer at the first call and at the second, whatever stands there.
 TEST_F(Faults, SettingsThatCannotBeReadMakeRoomForThoseOfBefore) {
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnMake;
-        bool blCopy;
-    } rgCases[] = {{"garbage", [] { Write(kRouterConf, "garbage\n"); }, false},
-                   {"garbage and a copy", [] { Write(kRouterConf, "garbage\n"); }, true},
-                   {"nothing but a comment", [] { Write(kRouterConf, "# nothing\n"); }, false},
-                   {"nothing but a comment and a copy", [] { Write(kRouterConf, "# nothing\n"); }, true},
-                   {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }, false},
-                   {"a link to nowhere and a copy", [] { symlink("/nowhere", kRouterConf); }, true}};
-    for (const auto& one : rgCases) {
-        SetUp();
-        one.fnMake();
-        if (one.blCopy) {
-            Write(std::string(kRouterConf) + ".bak", kOldSettings);
+    const std::pair<const char*, std::function<void()>> rgCases[] = {
+        {"garbage", [] { Write(kRouterConf, "garbage\n"); }},
+        {"nothing but a comment", [] { Write(kRouterConf, "# nothing\n"); }},
+        {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }}};
+    for (const auto& [szWhat, fnMake] : rgCases) {
+        for (const bool blCopy : {false, true}) {
+            SCOPED_TRACE(std::string(szWhat) + (blCopy ? " and a copy" : ""));
+            SetUp();
+            fnMake();
+            if (blCopy) {
+                Write(std::string(kRouterConf) + ".bak", kOldSettings);
+            }
+            for (int i = 0; i < 2; ++i) {
+                const auto pConf = std::make_unique<RouterConf>();
+                EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), blCopy ? 0 : 1);
+                EXPECT_EQ(Read(kRouterConf), blCopy ? kOldSettings : "");
+                EXPECT_EQ(Names(), blCopy ? Lines{"router.conf"} : Lines());
+            }
+            EXPECT_TRUE(Logged("file=/etc/portforward/router.conf has wrong format, try to unlink it"));
         }
-        for (int i = 0; i < 2; ++i) {
-            const auto pConf = std::make_unique<RouterConf>();
-            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), one.blCopy ? 0 : 1) << one.szWhat;
-            EXPECT_EQ(Read(kRouterConf), one.blCopy ? kOldSettings : "") << one.szWhat;
-            EXPECT_EQ(Names(), one.blCopy ? Lines{"router.conf"} : Lines()) << one.szWhat;
-        }
-        EXPECT_TRUE(Logged("file=/etc/portforward/router.conf has wrong format, try to unlink it"));
     }
 }
 
 TEST_F(Faults, ReadersNeverSeeNoSettingsWhileSomebodyWrites) {
-    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-    Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n");
-    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=1'\n");
-    chmod("/usr/tavo/bin/tavoportforward", 0755);
+    KnowTheRouter();
     for (const char* szSupport : {"no", "yes"}) {
         Write(kRouterConf, kOldSettings);
         const pid_t pid = fork();
         if (pid == 0) {
             for (int i = 0; i < 100; ++i) {
-                CallAndDie({"", szSupport, 1, true});
+                SetSettings(szSupport);
             }
             _exit(0);
         }
@@ -495,55 +474,38 @@ TEST_F(Faults, ReadersNeverSeeFewerRulesThanTwoWritersWrite) {
 }
 
 TEST_F(Faults, AReplacedFileKeepsOwnerAndMode) {
-    const std::string szCache = SZF_DETECT_MANUAL_CACHE;
-    Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-    Write("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho 'syntax version=1'\n");
-    chmod("/usr/tavo/bin/tavoportforward", 0755);
-    const struct {
-        std::string szFile;
-        std::function<void()> fnWrite;
-    } rgWrites[] = {
-        {kRuleConf,
-         [] {
-             RouterRuleConfWriter writer;
-             EXPECT_EQ(Add(writer) + writer.Sync(), 2);
-         }},
-        {kRouterConf,
-         [] {
-             RouterConfWriter writer(true);
-             EXPECT_EQ(writer.SetBrand("new") + writer.Sync(), 2);
-         }},
-        {kRouterConf,
-         [] {
-             CallAndDie({"", "yes", 1, true});
-         }},
-        {kRouterConf,
-         [] {
-             CallAndDie({"", "no", 1, true});
-         }},
-        {szCache, [] { EXPECT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1); }},
-        {"/etc/portforward/router_upnp.db.user",
-         [] {
-             RouterUpnpDBUserWriter writer("a/b/c");
-             EXPECT_TRUE(writer.SetMaxRule(5) && writer.Sync());
-         }},
+    KnowTheRouter();
+    const auto fnSet = [](const char* szUpnp) { return [=] { SetSettings(szUpnp); }; };
+    const auto fnRule = [] {
+        RouterRuleConfWriter writer;
+        EXPECT_EQ(Add(writer) + writer.Sync(), 2);
+    };
+    const auto fnBrand = [] {
+        RouterConfWriter writer(true);
+        EXPECT_EQ(writer.SetBrand("new") + writer.Sync(), 2);
+    };
+    const auto fnMost = [] {
+        RouterUpnpDBUserWriter writer("a/b/c");
+        EXPECT_TRUE(writer.SetMaxRule(5) && writer.Sync());
+    };
+    const std::pair<std::string, std::function<void()>> rgWrites[] = {
+        {kRuleConf, fnRule},
+        {kRouterConf, fnBrand},
+        {kRouterConf, fnSet("yes")},
+        {kRouterConf, fnSet("no")},
+        {SZF_DETECT_MANUAL_CACHE, [] { EXPECT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1); }},
+        {"/etc/portforward/router_upnp.db.user", fnMost},
         {kSystemConf, [] { EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr), 1); }},
     };
     // Settings that anybody could read are their owner's alone once they hold the password of a router's pages.
     const auto fnSetAccount = [](const char* szPass) {
-        RouterConfWriter writer(true);
-        EXPECT_EQ(writer.SetUserPass("me", szPass) + writer.Sync(), 2);
+        return [=] {
+            RouterConfWriter writer(true);
+            EXPECT_EQ(writer.SetUserPass("me", szPass) + writer.Sync(), 2);
+        };
     };
-    const std::pair<unsigned, std::function<void()>> rgModes[] = {{0644,
-                                                                   [] {
-                                                                       CallAndDie({"", "yes", 1, true});
-                                                                   }},
-                                                                  {0600,
-                                                                   [] {
-                                                                       CallAndDie({"", "no", 1, true});
-                                                                   }},
-                                                                  {0644, [&] { fnSetAccount(""); }},
-                                                                  {0600, [&] { fnSetAccount("secret"); }}};
+    const std::pair<unsigned, std::function<void()>> rgModes[] = {
+        {0644, fnSet("yes")}, {0600, fnSet("no")}, {0644, fnSetAccount("")}, {0600, fnSetAccount("secret")}};
     for (const auto& [nMode, fnStore] : rgModes) {
         Write(kRouterConf, "");
         chmod(kRouterConf, 0644);
@@ -552,13 +514,13 @@ TEST_F(Faults, AReplacedFileKeepsOwnerAndMode) {
         stat(kRouterConf, &status);
         EXPECT_EQ(status.st_mode & 07777U, nMode) << Read(kRouterConf);
     }
-    for (const auto& write : rgWrites) {
-        SCOPED_TRACE(write.szFile);
-        const char* szFile = write.szFile.c_str();
+    for (const auto& [szPath, fnWrite] : rgWrites) {
+        SCOPED_TRACE(szPath);
+        const char* szFile = szPath.c_str();
         Write(szFile, "");
         chmod(szFile, 0640);
         const bool blOthers = chown(szFile, 1, 1) == 0;  // where there are other users
-        write.fnWrite();
+        fnWrite();
         struct stat status = {};
         stat(szFile, &status);
         EXPECT_GT(status.st_size, 0);

@@ -26,10 +26,7 @@ using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
 class Library : public testing::Test {
 protected:
     void SetUp() override {
-        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"}) {
-            std::filesystem::remove_all(szDir);
-            std::filesystem::create_directories(szDir);
-        }
+        MakeEmpty({"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"});
         std::filesystem::remove("/etc/tavoinfo.conf");
         gLog.clear();
         gSzGateway = "192.168.1.1";
@@ -50,8 +47,7 @@ protected:
               "[192.168.1.1]\nbrand=B\nmodel=M\nversion=1\nsupport_router_upnp=no\n"
               "support_router_natpmp=no\n");
         Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", szPages);
-        Write(kTool, "#!/bin/sh\ntouch /tmp/ran\n");
-        chmod(kTool, 0755);
+        WriteProgram(kTool, "touch /tmp/ran\n");
         std::filesystem::remove("/tmp/ran");
     }
 };
@@ -785,8 +781,7 @@ TEST_F(Library, SaveRefusesBadArgumentsBeforeAnyWork) {
 }
 
 TEST_F(Library, DaemonStatusIsReadBack) {
-    Write("/usr/tavo/sbin/upnpd", "#!/bin/sh\nwhile :; do /bin/sleep 1; done\n");
-    chmod("/usr/tavo/sbin/upnpd", 0755);
+    WriteProgram("/usr/tavo/sbin/upnpd", "while :; do /bin/sleep 1; done\n");
     UpnpDaemon daemon;
     bool blConflict = true, blError = true;
     std::string szConflict, szError;

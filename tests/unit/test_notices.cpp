@@ -308,14 +308,7 @@ TEST(HookQueue, PassesOnWhatFitsAndSaysWhatDoesNot) {
     static constexpr char kRunner[] = "/usr/tavo/bin/tavohook";
     const std::string szLost = "notice was not passed on to the hooks in /etc/tavo/hooks.d";
     const auto fnRunner = [](const char* szDoes) {
-        Write(kRunner, std::string("#!/bin/sh\necho $$ > /tmp/t/runner\n") + szDoes);
-        chmod(kRunner, 0755);
-    };
-    const auto fnGot = [](const std::string& szWanted) {
-        for (int i = 0; i < 500 && Read("/tmp/t/facts") != szWanted; ++i) {
-            usleep(10000);
-        }
-        return Read("/tmp/t/facts") == szWanted;
+        WriteProgram(kRunner, std::string("echo $$ > /tmp/t/runner\n") + szDoes);
     };
     for (const char* szPath : {"/etc/tavo/hooks.d", "/tmp/t"}) {
         std::filesystem::remove_all(szPath);
@@ -333,7 +326,8 @@ TEST(HookQueue, PassesOnWhatFitsAndSaysWhatDoesNot) {
         EXPECT_EQ(gLog, std::vector<std::string>());
         queue.Run({"A=" + szMost + "x"});
         EXPECT_EQ(gLog, std::vector<std::string>{szLost});
-        EXPECT_TRUE(fnGot(std::string("A=1\0B=2\0A=", 10) + szMost + '\0'));
+        const std::string szFacts = std::string("A=1\0B=2\0A=", 10) + szMost + '\0';
+        EXPECT_TRUE(SoonTrue([&] { return Read("/tmp/t/facts") == szFacts; }));
         kill(std::stoi(Read("/tmp/t/runner")), SIGKILL);
         usleep(100000);
         std::filesystem::remove("/tmp/t/facts");

@@ -147,8 +147,7 @@ TEST(Service, IsAskedForByTheSystemsNameAndItsManager) {
     constexpr char kDaemon[] = "/usr/tavo/sbin/playedd";
     constexpr const char* kPrograms[] = {"/etc/init.d/avahi-daemon", "/etc/init.d/other", "/usr/local/sbin/systemctl"};
     for (const char* szProgram : kPrograms) {
-        Write(szProgram, "#!/bin/sh\necho ${0##*/} \"$@\" >> /tmp/t/said\nexit $(cat /tmp/t/exit)\n");
-        chmod(szProgram, 0755);
+        WriteProgram(szProgram, "echo ${0##*/} \"$@\" >> /tmp/t/said\nexit $(cat /tmp/t/exit)\n");
     }
     Write("/etc/tavo/platform.conf", "[services]\nplayed=\"other\"\nbad=\"-x\"\n");
     for (const int nCase : {0, 3, 10, 13}) {  // the exit status; of systemd from 10 on
@@ -545,15 +544,12 @@ TEST(TestRules, AreReadBackAndOrdersAreBounded) {
 }
 
 TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
-    Write("/tmp/t/testupnp.sh", "#!/bin/sh\nwhile :; do /bin/sleep 1; done\n");
-    chmod("/tmp/t/testupnp.sh", 0755);
+    WriteProgram("/tmp/t/testupnp.sh", "while :; do /bin/sleep 1; done\n");
     EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
     const int fd = open("/tmp/t/held", O_RDWR | O_CREAT, 0600);  // deliberately inheritable
     ASSERT_EQ(TLIBCExec("/tmp/t/testupnp.sh", "--one", nullptr, nullptr, nullptr), 0);
-    for (int i = 0; i < 500 && TLIBCIsProcAlive("testupnp.sh") == 0; ++i) {
-        usleep(10000);  // the kernel tells of the program's start a moment before it shows its name
-    }
-    EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 1);
+    // The kernel tells of the program's start a moment before it shows its name.
+    EXPECT_TRUE(SoonTrue([] { return TLIBCIsProcAlive("testupnp.sh") == 1; }));
     EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh --one"), 1);
     EXPECT_EQ(TLIBCIsProcAlive("/bin/sh /tmp/t/testupnp.sh"), 0);
     const std::string szPids =
@@ -562,10 +558,7 @@ TEST(Process, IsFoundByNameScriptOrCommandLineUntilItEnds) {
     EXPECT_NE(TLIBCSystem(szPids.c_str()), 0);
     close(fd);
     EXPECT_GE(TLIBCKill("testupnp.sh", SIGKILL), 1);  // 2 where it has just forked and not yet become sleep
-    for (int i = 0; i < 500 && TLIBCIsProcAlive("testupnp.sh") == 1; ++i) {
-        usleep(10000);
-    }
-    EXPECT_EQ(TLIBCIsProcAlive("testupnp.sh"), 0);
+    EXPECT_TRUE(SoonTrue([] { return TLIBCIsProcAlive("testupnp.sh") == 0; }));
     EXPECT_EQ(TLIBCExec("/tmp/t/none", nullptr, nullptr, nullptr, nullptr), -1);
     EXPECT_EQ(TLIBCSystem("exit 3"), 3);
 }
@@ -583,9 +576,7 @@ TEST(Process, WhatIsStartedHearsEverySignal) {
               0);
     signal(SIGHUP, SIG_DFL);
     sigprocmask(SIG_SETMASK, &before, nullptr);
-    for (int i = 0; i < 500 && !std::filesystem::exists("/tmp/t/signals"); ++i) {
-        usleep(10000);
-    }
+    SoonTrue([] { return std::filesystem::exists("/tmp/t/signals"); });
     EXPECT_EQ(Read("/tmp/t/signals"), "SigBlk:\t0000000000000000\nSigIgn:\t0000000000000000\n");
 }
 
@@ -626,8 +617,7 @@ TEST(Hooks, AreRunOnlyWhereNobodyButRootOwnsThem) {
 
 TEST(RouterDatabase, ARefreshThatIsKilledOrFailsLosesNothing) {
     const std::string szDatabase = "/etc.defaults/portforward/routerdb";
-    Write("/usr/tavo/bin/wget", "#!/bin/sh\ncp /tmp/t/new.tgz \"$3\"\n");
-    chmod("/usr/tavo/bin/wget", 0755);
+    WriteProgram("/usr/tavo/bin/wget", "cp /tmp/t/new.tgz \"$3\"\n");
     Write("/etc/tavo/platform.conf", "[download]\ndatabase_url=\"http://192.0.2.1\"\n");
     const auto fnMake = [](const std::string& szPlace, int nEdition) {
         Write(szPlace + "/version", "version=\"" + std::to_string(nEdition) + "\"\n");

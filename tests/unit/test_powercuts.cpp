@@ -39,7 +39,7 @@ constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
 constexpr char kMadeFile[] = "/var/lib/tavo/upnp_made.conf";
 constexpr char kDraft[] = "/etc/portforward/rule.conf.draft";
 constexpr char kDatabase[] = "/etc.defaults/portforward/routerdb";
-constexpr char kNone[] = "nothing";
+constexpr const char* kNone = "nothing";
 constexpr char kBox[] = "192.168.1.2";
 const tavo::RouterName kRouter{"192.168.1.1", "aa:bb"};
 
@@ -49,17 +49,13 @@ protected:
         gSzGateway = "192.168.1.1";
         Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n[Old//]\nmax=1\n");
         Write(std::string(kDatabase) + "/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
-        ToolOfVersion(1);
+        WriteProgram(kTool, "echo 'syntax version=1'\n");
     }
     void TearDown() override {
         gStage = {};
         gFnOnSleep = nullptr;
         gBlDirectoriesFail = false;
         gBlExchanges = true;
-    }
-    static void ToolOfVersion(int nVersion) {
-        Write(kTool, "#!/bin/sh\necho 'syntax version=" + std::to_string(nVersion) + "'\n");
-        chmod(kTool, 0755);
     }
 
     Disk mDisk{{"/etc", "/etc.defaults", "/var/lib"}};
@@ -84,19 +80,7 @@ std::string SavedRule() {
 }
 
 bool SetSettings(const char* szUpnp, const char* szPass = "new") {
-    const auto pConf = std::make_unique<__tag_TAVO_ROUTER_CONF>();
-    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"},
-                                           {pConf->szModel, "R1"},
-                                           {pConf->szVersion, "1.0"},
-                                           {pConf->szSupportUpnp, szUpnp},
-                                           {pConf->szSupportNatpmp, "no"},
-                                           {pConf->szUser, "me"},
-                                           {pConf->szPass, szPass},
-                                           {pConf->szConnType, "http"},
-                                           {pConf->szConnPort, "80"}}) {
-        snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
-    }
-    return TLibSetRouterConf("192.168.1.1", pConf.get(), nullptr, true) == 0;
+    return TLibSetRouterConf("192.168.1.1", NewSettings(szUpnp, "no", "me", szPass).get(), nullptr, true) == 0;
 }
 
 // The way and the password; who may read a password is checked in passing.
@@ -110,12 +94,7 @@ std::string SavedSettings() {
 
 bool SendReport() {
     gStage.blOn = true;
-    gStage.fnRun = [](const std::string& szCommand) {
-        const size_t nName = szCommand.find('\'') + 1;
-        if (szCommand.starts_with("/bin/tar")) {
-            Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
-        }
-    };
+    gStage.fnRun = PackNothing;
     const bool blSent = TLibUploadTestUpnpCompatibilityFailResult() == 0;
     gStage = {};
     return blSent;
@@ -172,9 +151,27 @@ std::string EarlierRow(int nPort) {
            szPort + "\"\nrouter_last=\"" + szPort + "\"\nbox_first=\"" + szPort + "\"\nname=\"x\"\n\n";
 }
 
+bool KeepTest(const char* szResult) {
+    return tavo::SaveTestRules({{1, 1, true, szResult}});
+}
+
 std::string KeptTest() {
     const auto rgRules = tavo::LoadTestRules();
     return rgRules.empty() ? kNone : rgRules.front().szResult;
+}
+
+bool KeepKnown(const char* szLocation) {
+    tavo::KeepRouter("192.168.1.1", {szLocation, false});
+    return true;
+}
+
+bool CacheBrand(const char* szBrand) {
+    return SetDetectManualCache("192.168.1.1", szBrand, "", "") == 1;
+}
+
+bool RecordMost(int nMost) {
+    RouterUpnpDBUserWriter writer("a/b/c");
+    return writer.SetMaxRule(nMost) && writer.Sync();
 }
 
 bool StoreTask(const char* szValue) {
@@ -253,73 +250,61 @@ struct Store {
     bool blSilent = false;         // it does not say whether it has
 };
 
+// One whose writer takes the content.
+Store Plain(const char* szName, const std::function<bool(const char*)>& fnWrite, std::string (*pfnRead)(),
+            const char* szOld, const char* szNew, const char* szMeanwhile = "", bool blSilent = false) {
+    const auto fnBefore = [=] { return szOld == kNone || fnWrite(szOld); };
+    return {szName, fnBefore, [=] { return fnWrite(szNew); }, pfnRead, szOld, szNew, szMeanwhile, blSilent};
+}
+
 // Two files are deleted before they are written, by an old format; whoever finds nothing asks the router anew. Settings
 // that are tried stand there until they turn out to be of no use.
 const std::vector<Store>& Stores() {
     static const auto fnOldSettings = [] { SetSettings("no", "old"); };
+    static const auto fnOldTool = [] {
+        fnOldSettings();
+        WriteProgram(kTool, "echo 'syntax version=0'\n");
+    };
+    static const auto fnReadable = [] {
+        SetSettings("yes");
+        chmod(kRouterConf, 0644);
+    };
+    static const auto fnDetected = [] {
+        fnOldSettings();
+        Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
+              R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
+                  "able_get_brand_model_version":"yes"})");
+    };
+    static const auto fnManual = [] { return SetSettings("no"); };
     static const std::vector<Store> rgStores = {
-        {"rules", [] { SaveRule("1"); }, [] { return SaveRule("2"); }, SavedRule, "1", "2"},
-        {"the first rules", [] {}, [] { return SaveRule("2"); }, SavedRule, kNone, "2"},
+        Plain("rules", SaveRule, SavedRule, "1", "2"),
+        Plain("the first rules", SaveRule, SavedRule, kNone, "2"),
         {"a UPnP router's settings", fnOldSettings, [] { return SetSettings("yes"); }, SavedSettings, "noold", "yes"},
-        {"a manual router's settings", fnOldSettings, [] { return SetSettings("no"); }, SavedSettings, "noold",
-         "nonew"},
-        {"a router that becomes a manual one",
-         [] {
-             SetSettings("yes");
-             chmod(kRouterConf, 0644);
-         },
-         [] { return SetSettings("no"); }, SavedSettings, "yes", "nonew"},
-        {"settings that cannot be used",
-         [] {
-             fnOldSettings();
-             Write(kTool, "#!/bin/sh\necho 'syntax version=0'\n");
-         },
-         [] { return !SetSettings("no"); }, SavedSettings, "noold", "noold", "nonew", true},
-        {"a report",
-         [] {
-             fnOldSettings();
-             Write("/var/lib/tavo/tasks/@system/.upnp_detector.json",
-                   R"({"router_brand":"Acme","router_model":"R1","router_version":"1.0","support_upnp":"yes",
-                       "able_get_brand_model_version":"yes"})");
-         },
-         SendReport, SavedSettings, "noold", "noold"},
-        {"the detection's cache", [] { SetDetectManualCache("192.168.1.1", "Old", "", ""); },
-         [] { return SetDetectManualCache("192.168.1.1", "New", "", "") == 1; },
-         [] { return SectionValue(SZF_DETECT_MANUAL_CACHE.c_str(), "192.168.1.1", "brand"); }, "Old", "New", kNone},
-        {"a test's result", [] { Write(kUserDb, "[a/b/c]\nmax=\"1\"\n"); },
-         [] {
-             RouterUpnpDBUserWriter writer("a/b/c");
-             return writer.SetMaxRule(2) && writer.Sync();
-         },
+        {"a manual router's settings", fnOldSettings, fnManual, SavedSettings, "noold", "nonew"},
+        {"a router that becomes a manual one", fnReadable, fnManual, SavedSettings, "yes", "nonew"},
+        {"settings that cannot be used", fnOldTool, [] { return !SetSettings("no"); }, SavedSettings, "noold", "noold",
+         "nonew", true},
+        {"a report", fnDetected, SendReport, SavedSettings, "noold", "noold"},
+        Plain(
+            "the detection's cache", CacheBrand,
+            [] { return SectionValue(SZF_DETECT_MANUAL_CACHE.c_str(), "192.168.1.1", "brand"); }, "Old", "New", kNone),
+        {"a test's result", [] { Write(kUserDb, "[a/b/c]\nmax=\"1\"\n"); }, [] { return RecordMost(2); },
          [] { return SectionValue(kUserDb, "a/b/c", "max"); }, "1", "2", kNone},
         {"a key", [] { Write(kSystemConf, "hand=\"h\"\nrunupnpportmapping=\"yes\"\n"); },
          [] { return TLIBCFileSetKeyValue(kSystemConf, "runupnpportmapping", "no", nullptr) == 1; }, Keys, "hyes-",
          "hno-"},
-        {"upnpd's record", [] { KeepMade("old"); }, [] { return KeepMade("new"); }, KeptMade, "old", "new"},
-        {"upnpd's first record", [] {}, [] { return KeepMade("new"); }, KeptMade, kNone, "new"},
-        {"what was told", [] { KeepTold("old"); }, [] { return KeepTold("new"); }, KeptTold, "old", "new", "", true},
+        Plain("upnpd's record", KeepMade, KeptMade, "old", "new"),
+        Plain("upnpd's first record", KeepMade, KeptMade, kNone, "new"),
+        Plain("what was told", KeepTold, KeptTold, "old", "new", "", true),
         {"the forwarder's record of an earlier version", [] { Write(kEarlierFile, EarlierRow(1) + EarlierRow(2)); },
          TakeOverJobs, KeptJobs, "earlier", "12"},
-        {"a test's mappings",
-         [] {
-             tavo::SaveTestRules({{1, 1, true, "old"}});
-         },
-         [] {
-             return tavo::SaveTestRules({{1, 1, true, "new"}});
-         },
-         KeptTest, "old", "new"},
-        {"a known router",
-         [] {
-             tavo::KeepRouter("192.168.1.1", {{"old", ""}});
-         },
-         [] {
-             tavo::KeepRouter("192.168.1.1", {{"new", ""}});
-             return true;
-         },
-         [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old", "new", "", true},
-        {"a task", [] { StoreTask("old"); }, [] { return StoreTask("new"); }, StoredTask, "old", "new"},
-        {"the first task", [] {}, [] { return StoreTask("new"); }, StoredTask, kNone, "new"},
-        {"a draft", [] { WriteDraft("old"); }, [] { return WriteDraft("new"); }, ReadDraft, "old", "new"},
+        Plain("a test's mappings", KeepTest, KeptTest, "old", "new"),
+        Plain(
+            "a known router", KeepKnown, [] { return tavo::RecallRouter("192.168.1.1").szLocation; }, "old", "new", "",
+            true),
+        Plain("a task", StoreTask, StoredTask, "old", "new"),
+        Plain("the first task", StoreTask, StoredTask, kNone, "new"),
+        Plain("a draft", WriteDraft, ReadDraft, "old", "new"),
         {"a draft that is dropped", [] { WriteDraft("old"); }, [] { return tavo::cli::RemoveOwnFile(kDraft); },
          ReadDraft, "old", kNone},
         {"router descriptions", [] {}, RefreshDatabase, KnownModels, "Acme: R1(1.0)", "New: N1(1)"},
@@ -551,6 +536,10 @@ TEST_F(PowerCuts, WhatOthersWriteBesideTheKeysIsKeptAndTheKeysComeBack) {
     const auto fnSet = [](const char* szKey, const char* szValue) {
         EXPECT_EQ(TLIBCFileSetKeyValue(kSystemConf, szKey, szValue, nullptr), 1);
     };
+    const auto fnOther = [&] {
+        fnSet("runnatpmpportmapping", "yes");
+        fnSet("hand", "g");
+    };
     const struct {
         const char* szWhat;
         std::function<void()> fnWrite;
@@ -561,12 +550,7 @@ TEST_F(PowerCuts, WhatOthersWriteBesideTheKeysIsKeptAndTheKeysComeBack) {
                    {"a new key", [&] { fnSet("more", "m"); }, "hyesno"},
                    {"the same, word for word", [&] { fnReplace("hand", "hand"); }, "hnono"},
                    {"the key itself", [&] { fnSet("runupnpportmapping", "no"); }, "hnono"},
-                   {"the other daemon and another key",
-                    [&] {
-                        fnSet("runnatpmpportmapping", "yes");
-                        fnSet("hand", "g");
-                    },
-                    "gnoyes"}};
+                   {"the other daemon and another key", fnOther, "gnoyes"}};
     SetSettings("yes");
     for (const auto& one : rgCases) {
         std::filesystem::remove_all("/var/lib/tavo");

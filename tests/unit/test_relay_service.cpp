@@ -126,8 +126,7 @@ protected:
               "[Acme/R1/1.0]\nsupport=yes\nmax=32\n[AirPort//]\nsupport=yes\nmax=5\n[Acme/No/1.0]\nsupport=no\n");
         Write(kRouterConf, Conf("R1", "yes", "no"));
         Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
-        Write(kTool, "#!/bin/sh\n");
-        chmod(kTool, 0755);
+        WriteProgram(kTool, "");
         mNetwork = Network();
         mHome = Home();
         mHome.mappings = {{5000, 80, "TCP", "192.168.1.9", "", 1, 0}, {5002, 80, "TCP", "192.168.1.7", "", 1, 0}};

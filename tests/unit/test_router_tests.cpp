@@ -24,6 +24,7 @@ namespace {
 
 using TestResult = __tag_TAVO_ROUTER_TEST_COMPATIBILITY_RESULT;
 
+constexpr char kDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";
 constexpr char kProgress[] = "/tmp/upnp_test.progress";
 
 void Put(const char* szStep, const std::string& szWord) {
@@ -128,10 +129,7 @@ namespace {
 class RouterTests : public testing::Test {
 protected:
     void SetUp() override {
-        for (const char* szDir : {"/etc/portforward", "/usr/tavo/bin", "/var/lib/tavo/tasks"}) {
-            std::filesystem::remove_all(szDir);
-            std::filesystem::create_directories(szDir);
-        }
+        MakeEmpty({"/etc/portforward", "/usr/tavo/bin", "/var/lib/tavo/tasks"});
         Write("/etc/portforward/router_upnp.db", "[x/y/1]\nsupport=yes\n");
         for (const char* szFile : {kProgress, "/tmp/pfStatusRule"}) {
             std::filesystem::remove(szFile);
@@ -145,7 +143,7 @@ protected:
         gStage = {};
         gPNetwork = nullptr;
         gPClient = nullptr;
-        TLIBCKill("/usr/tavo/sbin/upnpd --debug -p", SIGKILL);
+        TLIBCKill(kDaemon, SIGKILL);
     }
     Network mNetwork;
     TestClient mClient;
@@ -335,19 +333,13 @@ TEST_F(RouterTests, RefusedStartsEndTheRunningTest) {
 
     // A daemon in test mode, by its command line.
     ASSERT_EQ(TLIBCSystem("perl -e '$0 = \"/usr/tavo/sbin/upnpd --debug -p\"; sleep 60' >/dev/null 2>&1 &"), 0);
-    for (int i = 0; i < 500 && TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p") != 1; ++i) {
-        usleep(10000);
-    }
-    ASSERT_EQ(TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p"), 1);
+    ASSERT_TRUE(SoonTrue([] { return TLIBCIsProcAlive(kDaemon) == 1; }));
     EXPECT_EQ(TLibTestUpnpCompatibility(10, &result, nullptr, nullptr, true), -1);
     EXPECT_TRUE(Logged("upnp compatibility test process:/usr/tavo/sbin/upnpd --debug -p is running"));
     EXPECT_EQ(mClient.rgszCalls.back(), "delete");
     Write(kProgress, "x=\"y\"\n");
     EXPECT_EQ(TLibStopTestUpnpCompatibility(), 0);
-    for (int i = 0; i < 500 && TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p") == 1; ++i) {
-        usleep(10000);
-    }
-    EXPECT_EQ(TLIBCIsProcAlive("/usr/tavo/sbin/upnpd --debug -p"), 0);  // SIGHUP ended it
+    EXPECT_TRUE(SoonTrue([] { return TLIBCIsProcAlive(kDaemon) == 0; })) << "SIGHUP ends it";
     EXPECT_FALSE(std::filesystem::exists(kProgress));
 }
 
@@ -356,7 +348,6 @@ TEST_F(RouterTests, TheClientOrdersWhatIsAskedOfItAndEndsTheDaemonWhenItGivesUp)
     gPNetwork = nullptr;
     gPClient = nullptr;
     static constexpr char kRules[] = "/var/lib/tavo/upnp_test.conf";
-    static constexpr char kDaemon[] = "/usr/tavo/sbin/upnpd --debug -p";
     std::filesystem::remove(kRules);
     std::error_code error;
     std::filesystem::rename("/usr/tavo/sbin/upnpd", "/usr/tavo/sbin/aside", error);  // another test's
@@ -381,11 +372,6 @@ TEST_F(RouterTests, TheClientOrdersWhatIsAskedOfItAndEndsTheDaemonWhenItGivesUp)
                 std::filesystem::exists("/tmp/pfStatusRule"));
     const auto fnKept = [](bool blKept) {
         Write(kRules, std::string("[1]\nr_port=7\ns_port=8\nenabled=") + (blKept ? "1" : "0") + "\nresult=1\n");
-    };
-    const auto fnWait = [](const std::function<bool()>& fnTrue) {
-        for (int i = 0; i < 500 && !fnTrue(); ++i) {
-            usleep(10000);
-        }
     };
     using Ask = std::function<int()>;
     const auto fnMarker = [](const char* szWanted) {
@@ -413,14 +399,14 @@ TEST_F(RouterTests, TheClientOrdersWhatIsAskedOfItAndEndsTheDaemonWhenItGivesUp)
               "bind(S, sockaddr_un('/var/run/upnpd_test.sock')); alarm(60); while (recv(S, $m, 99, 0), $m) {"
               "open(F, '>>/tmp/orders'); print F $m; close(F); exit if $m eq 'end' }");
         ASSERT_EQ(TLIBCSystem("perl /tmp/daemon >/dev/null 2>&1 &"), 0);
-        fnWait([] { return std::filesystem::exists("/var/run/upnpd_test.sock"); });
+        SoonTrue([] { return std::filesystem::exists("/var/run/upnpd_test.sock"); });
         EXPECT_EQ(fnAsk(), nAnswer) << szWhat;
         const bool blEnded = TLIBCIsProcAlive(kDaemon) == 0;
         EXPECT_TRUE(std::string(szWhat) == "end" || blEnded == (szOrder == "end"))
             << szWhat << ": its end is waited for";
-        fnWait([&szOrder = szOrder] { return Read("/tmp/orders") == szOrder; });
+        SoonTrue([&szOrder = szOrder] { return Read("/tmp/orders") == szOrder; });
         TLIBCKill(kDaemon, SIGKILL);
-        fnWait([] { return TLIBCIsProcAlive(kDaemon) == 0; });
+        SoonTrue([] { return TLIBCIsProcAlive(kDaemon) == 0; });
         EXPECT_EQ(Read("/tmp/orders"), szOrder) << szWhat;
         EXPECT_EQ(Read("/tmp/pfStatusRule"), szMarker) << szWhat;
         std::filesystem::remove("/var/run/upnpd_test.sock");
@@ -489,9 +475,8 @@ TEST_F(RouterTests, ReportArchivesAndPutsTheSettingsBack) {
         if (report.blSettings) {
             Write("/etc/portforward/router.conf", "[10.0.0.1]\nbrand=mine\n");
         }
-        Write("/usr/tavo/bin/curl",
-              "#!/bin/sh\nprintf '%s\\n' \"$@\" > /tmp/curl.args\nexit " + std::to_string(report.nCurl) + "\n");
-        chmod("/usr/tavo/bin/curl", 0755);
+        WriteProgram("/usr/tavo/bin/curl",
+                     "printf '%s\\n' \"$@\" > /tmp/curl.args\nexit " + std::to_string(report.nCurl) + "\n");
         std::filesystem::remove("/tmp/curl.args");
         EXPECT_EQ(TLibUploadTestUpnpCompatibilityFailResult(), report.nCurl == 0 ? 0 : -1);
         EXPECT_EQ(Logged("update upnp router info failed"), report.nCurl != 0);
@@ -583,12 +568,7 @@ TEST_F(RouterTests, SurviveMemoryThatRunsOut) {
     constexpr char kSettings[] = "[10.0.0.1]\nbrand=mine\n";
     constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
     gStage.blOn = true;  // no daemon, and commands that only say what they are
-    gStage.fnRun = [](const std::string& szCommand) {
-        if (szCommand.starts_with("/bin/tar")) {
-            const size_t nName = szCommand.find('\'') + 1;
-            Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
-        }
-    };
+    gStage.fnRun = PackNothing;
     SetDetected("a brand longer than a small string");
     mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"a brand longer than a small string", "R1", "1.0"};
     const std::string szKnown = Read(kUserDb);

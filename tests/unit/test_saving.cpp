@@ -30,10 +30,7 @@ using Story = std::vector<std::string>;
 class Saving : public testing::Test {
 protected:
     void SetUp() override {
-        for (const char* szDir : {"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"}) {
-            std::filesystem::remove_all(szDir);
-            std::filesystem::create_directories(szDir);
-        }
+        MakeEmpty({"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"});
         Write("/etc/portforward/router_upnp.db",
               "[B/M/1]\nmax=2\n[" + kLong + " brand/" + kLong + " model/" + kLong + " version]\nmax=2\n");
         Write("/etc.defaults/portforward/routerdb/B/M/1/router.des", "[PF port page]\nmax rule=10\n");
@@ -313,11 +310,6 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
     }
 }
 
-void MakeTool(const std::string& szScript) {
-    Write(kTool, "#!/bin/sh\n" + szScript);
-    chmod(kTool, 0755);
-}
-
 TEST_F(Saving, AHashWithoutMemoryKeepsWhatItHas) {
     RunOutOfMemory([](const auto& fnArm) {
         TLIBCSzHash* pHash = TLIBCSzHashAlloc(0);
@@ -345,10 +337,10 @@ TEST_F(Saving, ReadsTheVersionOfTheTool) {
                      {"syntax version=junk\\n", 0},
                      {"", -1}};
     for (const auto& output : rgOutputs) {
-        MakeTool("printf '" + std::string(output.szOutput) + "'\nexit 3\n");
+        WriteProgram(kTool, "printf '" + std::string(output.szOutput) + "'\nexit 3\n");
         EXPECT_EQ(IGetCurrSyntaxVersion(), output.nVersion) << output.szOutput;
     }
-    MakeTool("/usr/bin/head -c 200000 /dev/zero | /usr/bin/tr '\\0' x; printf '\\nsyntax version=7\\n'\n");
+    WriteProgram(kTool, "/usr/bin/head -c 200000 /dev/zero | /usr/bin/tr '\\0' x; printf '\\nsyntax version=7\\n'\n");
     EXPECT_EQ(IGetCurrSyntaxVersion(), 7);
     std::filesystem::remove(kTool);
     EXPECT_EQ(IGetCurrSyntaxVersion(), -1);
@@ -358,20 +350,17 @@ TEST_F(Saving, GivesUpAToolThatHangs) {
     gStage.blOn = false;
     for (const char* szScript : {"while :; do /bin/sleep 1; done\n", "exec >&-\nwhile :; do /bin/sleep 1; done\n",
                                  "while :; do echo x; done\n"}) {
-        MakeTool(szScript);
+        WriteProgram(kTool, szScript);
         gNClockStep = 1;
         EXPECT_EQ(IGetCurrSyntaxVersion(), -1);
         gNClockStep = 0;
-        for (int i = 0; i < 500 && TLIBCIsProcAlive("tavoportforward") == 1; ++i) {
-            usleep(10000);
-        }
-        EXPECT_EQ(TLIBCIsProcAlive("tavoportforward"), 0) << szScript;
+        EXPECT_TRUE(SoonTrue([] { return TLIBCIsProcAlive("tavoportforward") == 0; })) << szScript;
     }
 }
 
 TEST_F(Saving, NoToolThatStaysAliveKeepsTheLock) {
     gStage.blOn = false;
-    MakeTool("/bin/sleep 20 &\necho syntax version=3\n");
+    WriteProgram(kTool, "/bin/sleep 20 &\necho syntax version=3\n");
     // A process that dies with the lock leaves it to nobody: neither to the tool's child nor to its own.
     const pid_t pid = fork();
     if (pid == 0) {
@@ -385,11 +374,7 @@ TEST_F(Saving, NoToolThatStaysAliveKeepsTheLock) {
     EXPECT_EQ(nStatus, 0);
     EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
     int nKilled = 0;
-    for (int i = 0; i < 500 && nKilled < 4; ++i) {
-        nKilled += TLIBCKill("/bin/sleep 20", SIGKILL);
-        usleep(10000);
-    }
-    EXPECT_GE(nKilled, 4);
+    EXPECT_TRUE(SoonTrue([&] { return (nKilled += TLIBCKill("/bin/sleep 20", SIGKILL)) >= 4; }));
 }
 
 TEST_F(Saving, RefreshesTheDatabaseOfItsOwnVersionOnly) {
@@ -397,7 +382,7 @@ TEST_F(Saving, RefreshesTheDatabaseOfItsOwnVersionOnly) {
     const std::string szTo = "' -O /etc/portforward/";
     const std::string szVersion = szFetch + "routersdk_version" + szTo + "routersdk_version >/dev/null 2>&1";
     const std::string szDb = szFetch + "router_upnp.db" + szTo + "router_upnp.db >/dev/null 2>&1";
-    MakeTool("echo syntax version = 3\n");
+    WriteProgram(kTool, "echo syntax version = 3\n");
     const struct {
         const char* szServed;  // the version file as it comes
         const char* szFail;

@@ -1,5 +1,4 @@
 // The stand-ins behind the stage; off stage they pass on to the platform and the C library.
-#include <dlfcn.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/file.h>
@@ -28,11 +27,6 @@ bool Fails(const char* szCall) {
     return gStage.blOn && gStage.szFail == szCall && gStage.nWorks-- <= 0;
 }
 
-template <typename Function>
-Function* Next(Function* /*fnHere*/, const char* szName) {
-    return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, szName));
-}
-
 // Whether another process could take the router lock now.
 bool IsLockFree() {
     const int fd = open("/tmp/routerconf.lock", O_RDWR | O_CREAT | O_CLOEXEC, 0600);
@@ -46,11 +40,11 @@ bool IsLockFree() {
 extern "C" {
 
 TLIBCSzHash* TLIBCSzHashAlloc(int nSize) {
-    return Fails("hash") ? nullptr : Next(&TLIBCSzHashAlloc, "TLIBCSzHashAlloc")(nSize);
+    return Fails("hash") ? nullptr : Real("TLIBCSzHashAlloc", &TLIBCSzHashAlloc)(nSize);
 }
 
 int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szValue) {
-    return Fails(szKey) ? -1 : Next(&TLIBCSzHashSetValue, "TLIBCSzHashSetValue")(pHash, szKey, szValue);
+    return Fails(szKey) ? -1 : Real("TLIBCSzHashSetValue", &TLIBCSzHashSetValue)(pHash, szKey, szValue);
 }
 
 int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szValue, const char* szFormat) {
@@ -59,25 +53,25 @@ int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szVa
         Tell(std::string(szKey) + "=" + szValue);
     }
     return Fails("run key") ? -1
-                            : Next(&TLIBCFileSetKeyValue, "TLIBCFileSetKeyValue")(szPath, szKey, szValue, szFormat);
+                            : Real("TLIBCFileSetKeyValue", &TLIBCFileSetKeyValue)(szPath, szKey, szValue, szFormat);
 }
 
 int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const char* szKey, char* szValue, int nSize) {
     return Fails("look-up")
                ? -1
-               : Next(&TLIBCFileGetSectionValue, "TLIBCFileGetSectionValue")(szPath, szSection, szKey, szValue, nSize);
+               : Real("TLIBCFileGetSectionValue", &TLIBCFileGetSectionValue)(szPath, szSection, szKey, szValue, nSize);
 }
 
 int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppHash, const char* szSeparator) {
-    return Fails("status") ? -1 : Next(&TLIBCFileGetKeys, "TLIBCFileGetKeys")(szPath, szPrefix, ppHash, szSeparator);
+    return Fails("status") ? -1 : Real("TLIBCFileGetKeys", &TLIBCFileGetKeys)(szPath, szPrefix, ppHash, szSeparator);
 }
 
 int TLIBPFCountRuleConf(const TAVO_PF_CONF* pHead, int nEnabledOnly) {
-    return Fails("count") ? -1 : Next(&TLIBPFCountRuleConf, "TLIBPFCountRuleConf")(pHead, nEnabledOnly);
+    return Fails("count") ? -1 : Real("TLIBPFCountRuleConf", &TLIBPFCountRuleConf)(pHead, nEnabledOnly);
 }
 
 int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, const char* szJob) {
-    return Fails(szJob) ? -1 : Next(&TAVOPFCountJobNumber, "TAVOPFCountJobNumber")(pHead, szGwRouterIP, szJob);
+    return Fails(szJob) ? -1 : Real("TAVOPFCountJobNumber", &TAVOPFCountJobNumber)(pHead, szGwRouterIP, szJob);
 }
 
 int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
@@ -85,23 +79,23 @@ int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
         const OwnMemory own;
         Tell("write " + std::string(szPath));
     }
-    return Fails("write") ? -1 : Next(&TAVOPFRuleBuildByPath, "TAVOPFRuleBuildByPath")(pHead, szPath);
+    return Fails("write") ? -1 : Real("TAVOPFRuleBuildByPath", &TAVOPFRuleBuildByPath)(pHead, szPath);
 }
 
 int NetpmpRemapGet(char** ppszRemap, int* pnSize) {
     if (gStage.blOn) {
         Tell("remap");
     }
-    return Fails("remap") ? -1 : Next(&NetpmpRemapGet, "NetpmpRemapGet")(ppszRemap, pnSize);
+    return Fails("remap") ? -1 : Real("NetpmpRemapGet", &NetpmpRemapGet)(ppszRemap, pnSize);
 }
 
 const char* GetRouterDBPath() {
-    return gStage.blOn ? gStage.szLocation.c_str() : Next(&GetRouterDBPath, "GetRouterDBPath")();
+    return gStage.blOn ? gStage.szLocation.c_str() : Real("GetRouterDBPath", &GetRouterDBPath)();
 }
 
 int TLIBCIsProcAlive(const char* szName) {
     if (!gStage.blOn) {
-        return Next(&TLIBCIsProcAlive, "TLIBCIsProcAlive")(szName);
+        return Real("TLIBCIsProcAlive", &TLIBCIsProcAlive)(szName);
     }
     const OwnMemory own;
     return gStage.alive.contains(szName) ? 1 : 0;
@@ -109,7 +103,7 @@ int TLIBCIsProcAlive(const char* szName) {
 
 int TLIBCKill(const char* szName, int nSignal) {
     if (!gStage.blOn) {
-        return Next(&TLIBCKill, "TLIBCKill")(szName, nSignal);
+        return Real("TLIBCKill", &TLIBCKill)(szName, nSignal);
     }
     const OwnMemory own;
     Tell("signal " + std::string(szName) + " " + std::to_string(nSignal));
@@ -118,7 +112,7 @@ int TLIBCKill(const char* szName, int nSignal) {
 
 int kill(pid_t pid, int nSignal) noexcept {
     if (!gStage.blOn || pid < 0) {
-        return Next(&kill, "kill")(pid, nSignal);
+        return Real("kill", &kill)(pid, nSignal);
     }
     const OwnMemory own;
     Tell("kill " + std::to_string(pid) + " " + std::to_string(nSignal));
@@ -128,7 +122,7 @@ int kill(pid_t pid, int nSignal) noexcept {
 
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4) {
     if (!gStage.blOn) {
-        return Next(&TLIBCExec, "TLIBCExec")(szPath, szArg1, szArg2, szArg3, szArg4);
+        return Real("TLIBCExec", &TLIBCExec)(szPath, szArg1, szArg2, szArg3, szArg4);
     }
     const OwnMemory own;
     Tell("exec " + std::string(szPath));
@@ -143,7 +137,7 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
 
 int TLIBCSystem(const char* szCommand) {
     if (!gStage.blOn) {
-        return Next(&TLIBCSystem, "TLIBCSystem")(szCommand);
+        return Real("TLIBCSystem", &TLIBCSystem)(szCommand);
     }
     const OwnMemory own;
     Tell("run " + std::string(szCommand));
@@ -159,7 +153,7 @@ int TLIBCSystem(const char* szCommand) {
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4) {
     if (!gStage.blOn) {
-        return Next(&TAVOLogSet1, "TAVOLogSet1")(nKind, nLevel, nEvent, szText1, szText2, szText3, szText4);
+        return Real("TAVOLogSet1", &TAVOLogSet1)(nKind, nLevel, nEvent, szText1, szText2, szText3, szText4);
     }
     const OwnMemory own;
     std::ostringstream line;
@@ -171,7 +165,7 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
 
 int TLIBServiceIsRunning(const char* szName) {
     if (!gStage.blOn) {
-        return Next(&TLIBServiceIsRunning, "TLIBServiceIsRunning")(szName);
+        return Real("TLIBServiceIsRunning", &TLIBServiceIsRunning)(szName);
     }
     const OwnMemory own;
     Tell("ask " + std::string(szName) + (IsLockFree() ? "" : ", still locked"));
@@ -180,7 +174,7 @@ int TLIBServiceIsRunning(const char* szName) {
 
 int TLIBServiceReload(const char* szName) {
     if (!gStage.blOn) {
-        return Next(&TLIBServiceReload, "TLIBServiceReload")(szName);
+        return Real("TLIBServiceReload", &TLIBServiceReload)(szName);
     }
     const OwnMemory own;
     Tell("reload " + std::string(szName));

@@ -94,8 +94,7 @@ int TAVOGwRouterConfSet(const TAVO_PF_CONF* pHead) {
     if (gFnOnConfSet) {
         return gFnOnConfSet();
     }
-    static const auto fnReal = reinterpret_cast<int (*)(const TAVO_PF_CONF*)>(dlsym(RTLD_NEXT, "TAVOGwRouterConfSet"));
-    return fnReal(pHead);
+    return Real("TAVOGwRouterConfSet", &TAVOGwRouterConfSet)(pHead);
 }
 
 unsigned sleep(unsigned nSeconds) {
@@ -107,7 +106,7 @@ unsigned sleep(unsigned nSeconds) {
 }
 
 int clock_gettime(clockid_t nClock, timespec* pTime) {
-    static const auto fnReal = reinterpret_cast<int (*)(clockid_t, timespec*)>(dlsym(RTLD_NEXT, "clock_gettime"));
+    static const auto fnReal = Real("clock_gettime", &clock_gettime);
     const int nResult = fnReal(nClock, pTime);
     pTime->tv_sec += gNClockJumped += gNClockStep;
     return nResult;

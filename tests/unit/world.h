@@ -1,12 +1,17 @@
 // What the tests share: the log lines of the system log, files at their fixed places, a fake gateway.
 #pragma once
 
+#include <dlfcn.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <memory>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -88,6 +93,53 @@ inline void Write(const std::string& szPath, const std::string& szText) {
     std::ofstream(szPath) << szText;
 }
 
+// A shell's lines.
+inline void WriteProgram(const std::string& szPath, const std::string& szLines) {
+    Write(szPath, "#!/bin/sh\n" + szLines);
+    chmod(szPath.c_str(), 0755);
+}
+
+inline void MakeEmpty(std::initializer_list<const char*> rgszDirs) {
+    for (const char* szDir : rgszDirs) {
+        std::filesystem::remove_all(szDir);
+        std::filesystem::create_directories(szDir);
+    }
+}
+
+// Whether it becomes so within five seconds.
+inline bool SoonTrue(const std::function<bool()>& fnTrue) {
+    for (int i = 0; i < 500 && !fnTrue(); ++i) {
+        usleep(10000);
+    }
+    return fnTrue();
+}
+
+// Settings of a router that a database may know.
+inline std::unique_ptr<__tag_TAVO_ROUTER_CONF> NewSettings(const char* szUpnp, const char* szNatpmp, const char* szUser,
+                                                           const char* szPass) {
+    auto pConf = std::make_unique<__tag_TAVO_ROUTER_CONF>();
+    for (const auto& [szField, szValue] : {std::pair{pConf->szBrand, "Acme"},
+                                           {pConf->szModel, "R1"},
+                                           {pConf->szVersion, "1.0"},
+                                           {pConf->szSupportUpnp, szUpnp},
+                                           {pConf->szSupportNatpmp, szNatpmp},
+                                           {pConf->szUser, szUser},
+                                           {pConf->szPass, szPass},
+                                           {pConf->szConnType, "http"},
+                                           {pConf->szConnPort, "80"}}) {
+        snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
+    }
+    return pConf;
+}
+
+// Plays the command that packs a report.
+inline void PackNothing(const std::string& szCommand) {
+    if (szCommand.starts_with("/bin/tar")) {
+        const size_t nName = szCommand.find('\'') + 1;
+        Write(szCommand.substr(nName, szCommand.find('\'', nName) - nName), "");
+    }
+}
+
 inline std::string Read(const std::string& szPath) {
     std::ostringstream text;
     text << std::ifstream(szPath).rdbuf();
@@ -111,6 +163,12 @@ inline std::string LastLines(const std::string& szLike) {
         szLast += (szLast.empty() ? "" : "\n") + gLog[i];
     }
     return szLast;
+}
+
+// The library's own function behind a stand-in.
+template <typename Function>
+Function* Real(const char* szName, Function*) {
+    return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, szName));
 }
 
 // Whether another process could take the lock now.
