@@ -25,7 +25,7 @@ TOOL = f"{BUILD}/cli/tavoportmap"
 NETCHECK = f"{BUILD}/platform/linux/tavo-netcheck"
 STAND_IN = f"{BUILD}/tests/cli/libstand_in.so"
 CONF = "/etc/portforward"
-RULES, ROUTER = f"{CONF}/rule.conf", f"{CONF}/router.conf"
+RULES, ROUTER, DATABASE = f"{CONF}/rule.conf", f"{CONF}/router.conf", f"{CONF}/router_upnp.db"
 DRAFT, OFF = f"{CONF}/rule.conf.draft", f"{CONF}/rules.off"
 MODELS = "/etc.defaults/portforward/routerdb"
 GATEWAY = "192.168.77.1"
@@ -37,8 +37,6 @@ version="1"
 support_router_upnp="%s"
 support_router_natpmp="%s"
 """
-
-
 WRITES = {"LD_PRELOAD": STAND_IN, "TAVO_SAVE": "0 0 write"}
 
 
@@ -59,8 +57,35 @@ def get(path):
         return file.read()
 
 
+def program(path, lines):
+    put(path, f"#!/bin/sh\n{lines}\n")
+    os.chmod(path, 0o755)
+
+
+def known(upnp="yes", natpmp="no", brand="Acme", most=None):
+    """The settings of the router, and how many rules it holds."""
+    put(ROUTER, KNOWN.replace("Acme", brand) % (upnp, natpmp))
+    if most is not None:
+        put(DATABASE, f'[{brand}/R1/1]\nsupport="yes"\nmax="{most}"\n')
+
+
+@contextlib.contextmanager
+def held(path="/tmp/routerconf.lock"):
+    with open(path, "w", encoding="utf-8") as lock:
+        fcntl.flock(lock, fcntl.LOCK_EX)
+        yield
+
+
+@contextlib.contextmanager
+def no_gateway():
+    subprocess.run(["ip", "route", "del", "default"], check=True)
+    try:
+        yield
+    finally:
+        subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True)
+
+
 def describe(brand, model, version):
-    os.makedirs(f"{MODELS}/{brand}/{model}/{version}", exist_ok=True)
     put(f"{MODELS}/{brand}/{model}/{version}/router.des",
         '[global]\nsyntax version="1"\n[PF port page]\ntcp="yes"\nudp="yes"\nchange router port="yes"\nmax rule="4"\n')
 
@@ -81,13 +106,23 @@ def on_terminal(*arguments, typed=b"", **environment):
     return os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), text.decode()
 
 
+def bound(keep, address, port, kind=socket.SOCK_STREAM, peer=None):
+    """A socket that lasts as long as others are kept, and listens where it is connected to nobody."""
+    made = keep.enter_context(socket.socket(socket.AF_INET6 if ":" in address else socket.AF_INET, kind))
+    made.bind((address, port))
+    if peer:
+        made.connect(peer)
+    elif kind == socket.SOCK_STREAM:
+        made.listen()
+
+
 class Tool(unittest.TestCase):
     def setUp(self):
         shutil.rmtree(MODELS, ignore_errors=True)
-        for path in (RULES, DRAFT, OFF, ROUTER, f"{CONF}/router_upnp.db.user", f"{CONF}/router_detect.cache"):
-            if os.path.exists(path):
+        for path in (RULES, DRAFT, OFF, ROUTER, f"{DATABASE}.user", f"{CONF}/router_detect.cache"):
+            with contextlib.suppress(FileNotFoundError):
                 os.unlink(path)
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="1"\n')
+        put(DATABASE, '[Acme/R1/1]\nsupport="yes"\nmax="1"\n')
 
     def json(self, *arguments, **environment):
         """One document on standard output, nothing beside it, and ok exactly with exit code 0."""
@@ -110,8 +145,7 @@ class Tool(unittest.TestCase):
 
     def saved(self):
         """The edits come into force as by a save that goes well."""
-        put(ROUTER, KNOWN % ("yes", "no"))
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
+        known(most=100)
         self.expect("save", OK, "in force|no rule is switched on", **WRITES)
 
     def test_a_hint_names_sudo_where_root_is_needed(self):
@@ -202,8 +236,7 @@ class Tool(unittest.TestCase):
 
     def test_no_port_comes_of_a_list_that_is_cut(self):
         """What is a byte too long for the library's records, or would be after a merge, is refused beforehand."""
-        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
-        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="0"\n')
+        known(brand="Zeta", most=0)
         world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:9", "TAVO_SAVE": "0 write"}
         listed = lambda *ends: ",".join(map(str, [*range(1001, 1408, 2), *ends]))
         self.assertEqual([len(listed()), len(listed(443))], [1019, 1023])
@@ -237,7 +270,7 @@ class Tool(unittest.TestCase):
         name = "\x1b[2Jx\r\n\u202eevil\u009b31m\x7f"
         self.assertEqual(tool("rules", "add", name, "--router-port", "80")[0], OK)
         self.assertEqual(self.rows()[0][5], name)
-        put(ROUTER, KNOWN.replace("Acme", r"\x1b]0;owned\x07") % ("yes", "no"))
+        known(brand=r"\x1b]0;owned\x07")
         for arguments in (("rules", "list"), ("rules", name), ("rules", "remove", name + "x"), ("status",), ("router", "show"),
                           ("rules", "add", "--router-port", name)):
             code, text = on_terminal(*arguments, NO_COLOR="1")
@@ -280,8 +313,7 @@ class Tool(unittest.TestCase):
     def test_a_held_lock_is_told_apart(self):
         tool("rules", "add", "--router-port", "80")
         self.saved()
-        with open("/tmp/routerconf.lock", "w", encoding="utf-8") as lock:
-            fcntl.flock(lock, fcntl.LOCK_EX)
+        with held():
             for arguments in ("rules add --router-port 81", "rules remove 1", "save", "router show",
                               "router set --upnp no --natpmp yes", "detect", "open 81", "close 80", "off", "rules discard"):
                 self.expect(arguments, BUSY, "another port-forwarding operation is running")
@@ -312,8 +344,7 @@ class Tool(unittest.TestCase):
     def test_a_reader_that_goes_away_ends_no_save(self):
         for port, streams in enumerate(("2>/dev/full", "2>&-", ">&- 2>&- <&-", "2> >(exec true)"), 80):
             tool("rules", "add", "--router-port", str(port))
-            put(ROUTER, KNOWN % ("yes", "no"))
-            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
+            known(most=100)
             run = subprocess.run(["bash", "-c", f"sleep .1; {TOOL} save {streams}"], env={**os.environ, **WRITES}, check=False, capture_output=True)
             self.assertEqual((run.returncode, str(port) in [rule["router_ports"] for rule in self.in_force()]),
                              (OK, True), streams)
@@ -380,8 +411,7 @@ class Tool(unittest.TestCase):
         self.expect("rules remove web", OK, "noted")
         self.expect("rules add new --router-port 90", OK, "rule 10 noted")
         self.expect("rules list", OK, r"10 +enabled +tcp +90 +90 +new +new, not saved\n7 +removed .*not saved")
-        put(ROUTER, KNOWN % ("yes", "no"))
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nmax="1"\n')
+        known(most=1)
         self.expect("save", TOO_MANY, "Nothing was changed(?s:.)*The edits stay noted")
         for damage in (lambda: put(DRAFT, "{}"), lambda: put(DRAFT, '{"base":' + "[" * 9000), lambda: put(DRAFT, ""),
                        lambda: os.makedirs(f"{DRAFT}/x"), lambda: os.symlink(RULES, DRAFT)):
@@ -397,8 +427,7 @@ class Tool(unittest.TestCase):
     def test_a_dry_run_tells_port_by_port(self):
         self.store((1, "tcp", "80-81", "80-81", "web"), (1, "udp", "53", "53", "dns"), (1, "tcp", "5000", "5000", "x"))
         world = {"LD_PRELOAD": STAND_IN, "TAVO_USED": "TCP:5000 TCP:90"}
-        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
-        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nmax="5"\n')
+        known(brand="Zeta", most=5)
         for edit in ("remove dns", "edit web --box-port 80,8081", "add --router-port 6000-6002 --protocol udp",
                      "add --router-port 81 --force", "add --router-port 90"):
             self.expect(f"rules {edit}", OK, "noted")
@@ -491,8 +520,7 @@ class Tool(unittest.TestCase):
                 ((off(web),), "off", OK, "nothing to switch off", (off(web),)),
                 ((web,), "on", OK, "nothing to switch on", (web,))):
             self.setUp()
-            put(ROUTER, KNOWN % ("yes", "no"))
-            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+            known(most=9)
             self.store(*before)
             tool("rules", "add", "unsaved", "--router-port", "7777")
             self.expect(command, code, pattern, **WRITES)
@@ -501,8 +529,7 @@ class Tool(unittest.TestCase):
             self.assertEqual([row[3] for row in self.rows() if row[5] == "unsaved"], ["7777"], "the edit still waits")
 
     def test_a_rule_file_that_is_another_one_after_the_save_is_pointed_out(self):
-        put(ROUTER, KNOWN % ("yes", "no"))
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        known(most=9)
         self.store((1, "tcp", "443", "8443", "web"))
         for command in ("open 80", "close 443", "off"):
             self.expect(command, OK, "warning: somebody else has changed", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
@@ -510,20 +537,18 @@ class Tool(unittest.TestCase):
     def test_without_a_word_on_these_rules_nothing_is_called_done(self):
         for command in ("open 80", "close 443", "off"):
             for said in (False, True):  # nothing at all, or of the rules before in the same second
-                pid = self.keep()
-                put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+                pid = self.keep(most=9)
                 if said:
                     self.publish(pid, at=int(time.time()) + 60)
                 self.expect(command, FAILED, "upnpd has not said what became of them(?s:.)*df /run", **WRITES)
 
     def test_an_address_that_nobody_outside_reaches_is_no_address_to_try(self):
-        pid = self.keep()
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        pid = self.keep(most=9)
         for outside, kind, pattern in (("198.41.0.4", "public", "from outside it is https://198.41.0.4/(?!(?s:.)*nobody on the Internet)"),
                                        ("192.168.0.9", "private", "warning: .*another router stands(?s:.)*nobody on the Internet"),
                                        ("100.64.0.9", "carrier", "warning: .*the provider's own(?s:.)*nobody on the Internet")):
             self.publish(pid, outside=outside, at=int(time.time()) + 60)
-            self.expect("open 443 --to 8443", OK, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0 write")
+            self.expect("open 443 --to 8443", OK, pattern, **WRITES)
             self.assertEqual(self.json("open", "443", "--to", "8443", **WRITES)[1]["outside_kind"], kind)
 
     def test_the_outcome_of_a_save_is_what_the_daemon_says(self):
@@ -540,8 +565,7 @@ class Tool(unittest.TestCase):
                 ((refused,), {"router": "unreachable"}, AWAY, "nothing was refused, and what is open there is not known(?s:.)*the daemon brings"),
                 ((), {"router": "no_upnp"}, AWAY, "does not offer UPnP(?s:.)*switch UPnP on"),
                 ((), {"router": "silent"}, AWAY, "192.168.77.1 does not answer(?s:.)*restart the router")):
-            pid = self.keep()
-            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="100"\n')
+            pid = self.keep(most=100)
             self.publish(pid, *rows, at=int(time.time()) + 60, **members)
             self.expect("save", code, pattern, **WRITES)
             told = self.json("save", **WRITES)[1]
@@ -558,7 +582,7 @@ class Tool(unittest.TestCase):
             self.setUp()
             describe("Acme", "R1", "1")
             put(ROUTER, KNOWN % (upnp, "no") + 'conn_type="http"\nconn_port="80"\n')
-            put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+            put(DATABASE, '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
             self.store((1, "tcp", "443", "443", "web"), (1, "tcp", "80", "80", ""))
             for command, left, pattern, again in (("close web", (80,), "443/tcp closed on this box, not yet on the router", "save"),
                                                   ("off", (), "every port is switched off on this box, not yet on the router", "off"),
@@ -590,14 +614,10 @@ class Tool(unittest.TestCase):
     def test_setup_offers_what_listens_here_and_opens_what_is_chosen(self):
         world = {**WRITES, "TAVO_DETECT": "0 0 0 1 1 0 32 10 20 30 40 70 50 80", "TAVO_WORD": "1 -1"}
         with contextlib.ExitStack() as keep:
-            def listen(address, port, kind=socket.SOCK_STREAM):
-                made = keep.enter_context(socket.socket(socket.AF_INET, kind))
-                made.bind((address, port))
-                kind == socket.SOCK_STREAM and made.listen()
             for address, port in (("0.0.0.0", 445), ("127.0.0.1", 7101), ("0.0.0.0", 7102), ("192.168.77.2", 7103), ("0.0.0.0", 7104)):
-                listen(address, port)
+                bound(keep, address, port)
             for port in (7105, 5353, 40000):  # the last is one that a program is given which only asks
-                listen("0.0.0.0", port, socket.SOCK_DGRAM)
+                bound(keep, "0.0.0.0", port, socket.SOCK_DGRAM)
             self.store((1, "tcp", "80", "7104", "web"))
             told = self.json("setup", "--yes", **world)[1]["could_be_opened"]
             self.assertEqual([(entry["port"], entry["protocol"], bool(entry["risk"])) for entry in told],
@@ -618,8 +638,7 @@ class Tool(unittest.TestCase):
                 self.expect(f"open {port}", OK, words, **world)
 
     def test_off_is_off_until_on(self):
-        put(ROUTER, KNOWN % ("yes", "no"))
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        known(most=9)
         self.store((1, "tcp", "443", "8443", "web"), (0, "tcp", "90", "90", "never"), (1, "udp", "53", "53", "dns"))
         self.expect("off", FAILED, "could not be written", LD_PRELOAD=STAND_IN, TAVO_SAVE="-1 0")
         self.assertFalse(os.path.exists(OFF))
@@ -672,7 +691,7 @@ class Tool(unittest.TestCase):
 
     def test_every_status_of_saving_is_explained(self):
         tool("rules", "add", "--router-port", "80")
-        put(ROUTER, KNOWN % ("yes", "no"))
+        known()
         for answer, code, pattern in (
                 ("0 0", OK, "1 rule in force on the router 192.168.77.1"),
                 ("-1 2", BUSY, "another port-forwarding operation"),
@@ -689,9 +708,9 @@ class Tool(unittest.TestCase):
                 ("-1 0 write", AWAY, "are stored, but upnpd could not be started(?s:.)*journalctl -t upnpd")):
             self.expect("save", code, pattern, LD_PRELOAD=STAND_IN, TAVO_SAVE=answer)
             self.assertEqual(self.json("save", LD_PRELOAD=STAND_IN, TAVO_SAVE=answer)[1]["status"], int(answer.split()[1]))
-        put(ROUTER, KNOWN % ("yes", "yes"))
+        known("yes", "yes")
         self.expect("save", REFUSED, "would not give these ports.*80 to 81", LD_PRELOAD=STAND_IN, TAVO_SAVE="-1 8 80 to 81")
-        put(ROUTER, KNOWN % ("no", "no"))
+        known("no", "no")
         describe("Acme", "R1", "1")
         self.expect("save", OK, "handed to(?s:.)*warning: .*did not say what they took", LD_PRELOAD=STAND_IN, TAVO_SAVE="0 0")
 
@@ -702,15 +721,15 @@ class Tool(unittest.TestCase):
         self.expect("save", FAILED, r"is about another router \(10.0.0.1\) than 192.168.77.1")
         put(ROUTER, (KNOWN % ("yes", "no")).replace("R1", "R2"))
         self.expect("save", FAILED, r"how many rules the router Acme R2 \(1\) holds(?s:.)*--max-rules")
-        put(ROUTER, KNOWN % ("no", "no"))
+        known("no", "no")
         self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*tavoportmap routers  +shows(?!(?s:.)*--update)")
         put("/etc/tavo/platform.conf", '[download]\ndatabase_url="http://127.0.0.1:1"\n')
         self.expect("save", FAILED, r"no description of the router Acme R1 \(1\)(?s:.)*sudo tavoportmap routers --update  ")
         os.unlink("/etc/tavo/platform.conf")
-        put(ROUTER, KNOWN % ("yes", "no"))
+        known()
         tool("rules", "add", "--router-port", "81")
         self.expect("save", TOO_MANY, "holds 1 rule and there are 2")
-        put(ROUTER, KNOWN % ("no", "no"))
+        known("no", "no")
         describe("Acme", "R1", "1")
         for edit, code, pattern in (("add --router-port 82,83", OK, "open +80-83/tcp"),
                                     ("add more --router-port 84", TOO_MANY, "holds 4 single ports and no ranges"),
@@ -720,7 +739,7 @@ class Tool(unittest.TestCase):
 
     def test_the_bar_never_goes_back_and_ends_its_line(self):
         steps = "10 20 30 40 70 50 80"
-        put(ROUTER, KNOWN % ("yes", "no"))
+        known()
         for command, environment in ((("save",), {"TAVO_SAVE": "-1 9 80/tcp"}),
                                      (("compat", "--yes"), {"TAVO_COMPAT": "1 0 Acme no -1 10 20 30 60 40 50"}),
                                      (("detect",), {"TAVO_DETECT": f"-1 4 0 1 2 2 -1 {steps}"})):
@@ -842,9 +861,7 @@ class Tool(unittest.TestCase):
         code, _, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
         self.assertEqual((code, "newer than the tool" in err), (FAILED, True), err)
         self.expect("router show --show-password", OK, "password +s3cret\n")
-        os.makedirs("/usr/tavo/bin", exist_ok=True)
-        put("/usr/tavo/bin/tavoportforward", "#!/bin/sh\necho syntax version=1\n")
-        os.chmod("/usr/tavo/bin/tavoportforward", 0o755)
+        program("/usr/tavo/bin/tavoportforward", "echo syntax version=1")
         code, out, err = tool("router", "set", "--password-file", "-", stdin="n3w\nrest\n")
         self.assertEqual(code, OK, err)
         self.expect("router show --show-password", OK, "user +admin\npassword +n3w\n")
@@ -862,7 +879,7 @@ class Tool(unittest.TestCase):
         self.expect("router show --show-password", OK, "user +admin\npassword +n4w\nconnection +http, port 8080")
 
     def test_a_password_that_is_not_given_after_all_leaves_the_terminal_as_it_was(self):
-        put(ROUTER, KNOWN % ("yes", "no"))
+        known()
         before = get(ROUTER)
         pid, fd = pty.fork()
         if pid == 0:
@@ -897,10 +914,10 @@ class Tool(unittest.TestCase):
             told = self.json("compat", LD_PRELOAD=STAND_IN, TAVO_COMPAT=answer)[1]
             self.assertEqual((told.get("failed_step"), told.get("max_rules"), told.get("recorded", False)),
                              (failed, held, False), answer)
-        self.assertFalse(os.path.exists(f"{CONF}/router_upnp.db.user"))
+        self.assertFalse(os.path.exists(f"{DATABASE}.user"))
 
     def test_what_a_test_found_is_recorded_on_request_and_saving_goes_by_it(self):
-        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        known(brand="Zeta")
         passed = {"LD_PRELOAD": STAND_IN, "TAVO_COMPAT": "0 0 Zeta yes 1 10 90"}
         failed = {"LD_PRELOAD": STAND_IN, "TAVO_COMPAT": "1 0 Zeta no -1 10 30"}
         self.expect("compat --record", OK, "recorded: .*more than 1 rules is refused", **passed)
@@ -910,7 +927,7 @@ class Tool(unittest.TestCase):
         self.expect("compat --record", FAILED, "not recorded", **failed)
         self.expect("router show", OK, "holds +1 rules")
         self.expect("compat --yes", FAILED, "recorded: .*as unknown", **failed)
-        self.assertIn('support="no"', get(f"{CONF}/router_upnp.db.user"))
+        self.assertIn('support="no"', get(f"{DATABASE}.user"))
         self.expect("compat --yes", OK, "database says that this router holds 1 rules", LD_PRELOAD=STAND_IN,
                     TAVO_COMPAT="0 0 Acme yes 7 10 90")
         for answer, recorded in ((b"y\n", True), (b"\n", False)):
@@ -930,7 +947,7 @@ class Tool(unittest.TestCase):
             self.assertEqual((run.returncode, out), (FAILED, ""))
             self.assertIn("the test is stopped", err)
             self.assertFalse(os.path.exists("/tmp/upnp_test.progress"))
-            self.assertFalse(os.path.exists(f"{CONF}/router_upnp.db.user"))
+            self.assertFalse(os.path.exists(f"{DATABASE}.user"))
 
     def test_a_running_test_is_left_alone_until_it_is_told_to_stop(self):
         put("/tmp/upnp_test.progress", "upnp_add=\"failed\"\n")
@@ -976,10 +993,9 @@ class Tool(unittest.TestCase):
 
     def test_a_report_says_what_it_lacks(self):
         files = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule")
-        os.makedirs("/usr/tavo/bin", exist_ok=True)
-        settings = KNOWN % ("yes", "no")
-        put(ROUTER, settings)
-        known = {"LD_PRELOAD": STAND_IN, "TAVO_LAST": "1 Acme"}
+        known()
+        settings = get(ROUTER)
+        tested = {"LD_PRELOAD": STAND_IN, "TAVO_LAST": "1 Acme"}
         put("/tmp/written", "by root, in time\n")
         for i, kind in itertools.product(range(5), ("link", "other", "old")):  # no archive of ours
             planted = f"/tmp/{kind}_{int(time.time()) + i}.tgz"
@@ -993,14 +1009,13 @@ class Tool(unittest.TestCase):
         for path in files:
             if os.path.exists(path):
                 os.unlink(path)
-        self.expect("report", FAILED, "did not leave /tmp/upnp_test.progress, (?s:.)*router.log", **known)
+        self.expect("report", FAILED, "did not leave /tmp/upnp_test.progress, (?s:.)*router.log", **tested)
         for path in files:
             put(path, "x\n")
-        put("/usr/tavo/bin/curl", "#!/bin/sh\nexit 22\n")
-        os.chmod("/usr/tavo/bin/curl", 0o755)
-        self.expect("report", FAILED, r"no server is named(?s:.)*stays in /tmp/Acme_\d+\.tgz", **known)
-        put("/usr/tavo/bin/curl", "#!/bin/sh\n")
-        told = self.json("report", **known)[1]
+        program("/usr/tavo/bin/curl", "exit 22")
+        self.expect("report", FAILED, r"no server is named(?s:.)*stays in /tmp/Acme_\d+\.tgz", **tested)
+        program("/usr/tavo/bin/curl", "")
+        told = self.json("report", **tested)[1]
         self.assertTrue(os.path.exists(told["archive"]), told)
         self.assertEqual(get(ROUTER), settings)
 
@@ -1021,12 +1036,12 @@ class Tool(unittest.TestCase):
 
     # ---- status ---------------------------------------------------------------------------------
 
-    def keep(self, on="upnp", alive=True):
+    def keep(self, on="upnp", alive=True, most=None):
         """Rules of one, two and no ports, the run key, and a process that counts as the daemon."""
         self.store((1, "tcp", "443", "8443", "web"), (1, "all", "53,5000-5001", "53,5000-5001", ""), (0, "tcp", "9", "9", "x"))
         put("/etc/tavoinfo.conf", f'runupnpportmapping="{"yes" if on == "upnp" else "no"}"\n'
                                   f'runnatpmpportmapping="{"yes" if on == "natpmp" else "no"}"\n')
-        put(ROUTER, KNOWN % ("yes", "no"))
+        known(most=most)
         shutil.rmtree("/run/tavo", ignore_errors=True)
         os.makedirs("/run/tavo")
         if alive:
@@ -1095,9 +1110,8 @@ class Tool(unittest.TestCase):
         put(ROUTER, (KNOWN % ("yes", "no")).replace(GATEWAY, "10.0.0.1"))
         self.publish(pid)
         self.expect("status", OK, "warning: the stored settings are those of the router 10.0.0.1, and the gateway is 192.168.77.1")
-        subprocess.run(["ip", "route", "del", "default"], check=True)
-        self.expect("status", AWAY, "no default gateway")
-        subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True)
+        with no_gateway():
+            self.expect("status", AWAY, "no default gateway")
         tool("rules", "add", "new", "--router-port", "81")
         tool("rules", "remove", "7")
         self.expect("status", OK, r"10 new +81/tcp +new\n7 web +443/tcp to 8443 +removed\n(?s:.)*all 2 rules are in force"
@@ -1109,8 +1123,7 @@ class Tool(unittest.TestCase):
 
     def test_status_says_what_the_service_manager_has_of_the_daemon(self):
         """The unit's state by systemctl, whether the daemon lives, and the words that tell of it."""
-        put("/usr/bin/systemctl.new", "#!/bin/sh\ncat /tmp/unit\n")
-        os.chmod("/usr/bin/systemctl.new", 0o755)
+        program("/usr/bin/systemctl.new", "cat /tmp/unit")
         os.rename("/usr/bin/systemctl.new", "/usr/bin/systemctl")  # a real one is nobody's in a user's sandbox: only its place is ours
         os.makedirs("/run/systemd/system")
         self.addCleanup(shutil.rmtree, "/run/systemd")
@@ -1144,21 +1157,18 @@ class Tool(unittest.TestCase):
         self.store((1, "tcp", "443", "8443", "web"))
         tool("rules", "add", "new", "--router-port", "81")
         before = get(RULES)
-        subprocess.run(["ip", "route", "del", "default"], check=True)
-        self.addCleanup(lambda: subprocess.run(["ip", "route", "add", "default", "via", GATEWAY], check=True))
-        for command in ("close 443", "off", "save"):
-            self.expect(command, AWAY, "no default gateway(?s:.)*\nNothing was changed", **WRITES)
-        for code, commands in ((AWAY, ("status",)),
-                               (FAILED, ("setup", "detect", "open 80", "save --dry-run", "router set --upnp yes", "router show",
-                                         "router table", "compat --yes", "report", "service set hoplink 80/tcp", "service detect"))):
-            for command in commands:
-                self.expect(command, code, "no default gateway", **WRITES)
+        with no_gateway():
+            for command in ("close 443", "off", "save"):
+                self.expect(command, AWAY, "no default gateway(?s:.)*\nNothing was changed", **WRITES)
+            for command in ("setup", "detect", "open 80", "save --dry-run", "router set --upnp yes", "router show", "router table",
+                            "compat --yes", "report", "service set hoplink 80/tcp", "service detect", "status"):
+                self.expect(command, AWAY if command == "status" else FAILED, "no default gateway", **WRITES)
         self.assertEqual((get(RULES), os.path.exists(ROUTER), os.path.exists(OFF)), (before, False, False))
         self.assertEqual([row[3] for row in self.rows()], ["443", "81"], "the edit still waits")
 
     def test_status_of_a_router_that_is_driven_through_its_pages(self):
         self.keep(on="none", alive=False)
-        put(ROUTER, KNOWN % ("no", "no"))
+        known("no", "no")
         self.assertEqual(self.standing(), (FAILED, "unknown", ["unknown", "unknown", "off"]))
         self.publish(1, name="tavoportforward", protocol="pages")
         self.expect("status", OK, "all 2 rules are in force, as the router's pages took them at")
@@ -1177,7 +1187,7 @@ class Tool(unittest.TestCase):
         for path in (program, reader):
             os.symlink(f"{BUILD}/programs/tavoportforward", path)
         self.addCleanup(remove, program, reader, record, "/run/tavo/tavoportforward.json")
-        put(f"{CONF}/router_upnp.db", '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
+        put(DATABASE, '[Acme/R1/1]\nsupport="yes"\nmax="9"\n')
         why = "own pages forward it: take it away there \\(there are no settings for the pages of the router 192.168.77.1; .*upnp yes goes back\\)"
         for text, names in ((row.format(GATEWAY, "", "TCP", 443, 0) + row.format(GATEWAY, "", "BOTH", 7000, 4), ["7000-7004/both", "443/tcp"]),
                             (row.format("10.9.9.9", "", "TCP", 443, 0), []), ("", []), ("no record\n", [])):
@@ -1338,8 +1348,7 @@ class Tool(unittest.TestCase):
     def test_status_knows_a_detection_by_its_lock(self):
         self.keep(on="none", alive=False)
         for path in ("/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock"):
-            with open(path, "w", encoding="utf-8") as lock:
-                fcntl.flock(lock, fcntl.LOCK_EX)
+            with held(path):
                 self.expect("status", AWAY, "running now +a detection(?s:.)*nothing is kept while a detection of the router goes on")
             other = "/run/other.lock"  # a lock of somebody else, on a file of the same number elsewhere
             put(other, "")
@@ -1361,8 +1370,7 @@ class Tool(unittest.TestCase):
 
     def test_who_keeps_a_port(self):
         """Each case: rules of ours, the request, what stays out and why, or why all of it fails."""
-        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
-        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="3"\n')
+        known(brand="Zeta", most=3)
         no_port = {}
         for rules, request, out, after, fails in (
                 ((), "80/tcp 90-91/udp", no_port, ["80", "90-91"], None),
@@ -1399,8 +1407,7 @@ class Tool(unittest.TestCase):
         protocol = lambda: dice.choice(["tcp", "tcp", "udp", "all"])
         outcomes = {}
         for turn in range(60):
-            put(ROUTER, KNOWN.replace("Acme", "Zeta") % (("yes", "no") if turn % 2 else ("no", "yes")))
-            put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="0"\n')
+            known(*(("yes", "no") if turn % 2 else ("no", "yes")), brand="Zeta", most=0)
             rules = []
             for _ in range(dice.randrange(4)):
                 ports = span()
@@ -1431,11 +1438,11 @@ class Tool(unittest.TestCase):
             self.expect(f"service {arguments}", USAGE, pattern)
         self.expect("service set hoplink 80/tcp", FAILED, "not been detected yet: .*service detect", **world)
         self.expect("service plan hoplink 80/tcp", FAILED, "would fail: the router has not been detected", **world)
-        put(ROUTER, KNOWN % ("no", "no"))
+        known("no", "no")
         self.expect("service set hoplink 80/tcp", FAILED, "nothing was changed: .*own pages", **world)
-        put(ROUTER, (KNOWN % ("yes", "no")).replace("Acme", "Zeta"))
+        known(brand="Zeta")
         self.expect("service set hoplink 80/tcp", FAILED, "nobody has recorded how many rules", **world)
-        put(f"{CONF}/router_upnp.db", '[Zeta/R1/1]\nsupport="yes"\nmax="9"\n')
+        put(DATABASE, '[Zeta/R1/1]\nsupport="yes"\nmax="9"\n')
         self.expect("service list", OK, "no rule belongs to a service")
         self.store((1, "tcp", "443", "8443", "web"))
         self.expect("service set hoplink 80/tcp 81/udp --test", REFUSED,
@@ -1451,8 +1458,7 @@ class Tool(unittest.TestCase):
         self.expect("service set hoplink 80/tcp", FAILED, "stored, but the router did not take them all",
                     **{**world, "TAVO_SAVE": "-1 write"})
         self.expect("service set hoplink 81/tcp", FAILED, "service plan.* shows", **{**world, "TAVO_SAVE": "-1"})
-        with open("/tmp/routerconf.lock", "w", encoding="utf-8") as lock:
-            fcntl.flock(lock, fcntl.LOCK_EX)
+        with held():
             for arguments in ("set hoplink 80/tcp", "clear hoplink", "detect", "plan hoplink 80/tcp"):
                 self.expect(f"service {arguments}", BUSY, "another port-forwarding operation", **world)
 
@@ -1466,30 +1472,18 @@ class Tool(unittest.TestCase):
             world = {"LD_PRELOAD": STAND_IN, "TAVO_DETECT": detected, "TAVO_COMPAT": tested}
             got, out, err = tool("service", "detect", **world)
             self.assertEqual((got, len(re.findall(pattern, out + err))), (code, 1), (detected, tested, out, err))
-            self.assertEqual(os.path.exists(f"{CONF}/router_upnp.db.user"), bool(tested))
+            self.assertEqual(os.path.exists(f"{DATABASE}.user"), bool(tested))
 
     def test_what_listens_on_this_box(self):
         """Real sockets, a program of another name, and a port that the packet filter hands to a container."""
         with contextlib.ExitStack() as keep:
-            def bound(family, kind, address, port, peer=None):
-                made = keep.enter_context(socket.socket(family, kind))
-                made.bind((address, port))
-                if peer:
-                    made.connect(peer)
-                elif kind == socket.SOCK_STREAM:
-                    made.listen()
-            for family, kind, address, port, peer in (
-                    (socket.AF_INET, socket.SOCK_STREAM, "0.0.0.0", 7001, None),
-                    (socket.AF_INET, socket.SOCK_STREAM, "127.0.0.1", 7002, None),
-                    (socket.AF_INET6, socket.SOCK_STREAM, "::", 7003, None),
-                    (socket.AF_INET6, socket.SOCK_STREAM, "::1", 7004, None),
-                    (socket.AF_INET6, socket.SOCK_STREAM, "::ffff:127.0.0.1", 7005, None),
-                    (socket.AF_INET, socket.SOCK_STREAM, "192.168.77.2", 7006, None),
-                    (socket.AF_INET, socket.SOCK_DGRAM, "0.0.0.0", 7007, None),
-                    (socket.AF_INET, socket.SOCK_DGRAM, "127.0.0.1", 7008, ("127.0.0.1", 9)),
-                    (socket.AF_INET, socket.SOCK_STREAM, "127.0.0.1", 7009, ("127.0.0.1", 7002))):
-                bound(family, kind, address, port, peer)
-            carrier = "import socket; s=socket.create_server(('0.0.0.0', 7010)); print(1, flush=True); input()"
+            for address, port in (("0.0.0.0", 7001), ("127.0.0.1", 7002), ("::", 7003), ("::1", 7004), ("::ffff:127.0.0.1", 7005),
+                                  ("192.168.77.2", 7006)):
+                bound(keep, address, port)
+            bound(keep, "0.0.0.0", 7007, socket.SOCK_DGRAM)
+            bound(keep, "127.0.0.1", 7008, socket.SOCK_DGRAM, ("127.0.0.1", 9))
+            bound(keep, "127.0.0.1", 7009, peer=("127.0.0.1", 7002))
+            carrier = "import socket; s=socket.create_server(('0.0.0.0', 7010)); print(1, flush=True); import sys; sys.stdin.read()"
             put("/proc/self/comm", "tester")
             put("/tmp/run.py", f"open('/proc/self/comm', 'w').write('docker-proxy')\n{carrier}\n")
             other = keep.enter_context(subprocess.Popen(["/usr/bin/python3", "/tmp/run.py"], stdin=subprocess.PIPE,
@@ -1526,8 +1520,7 @@ class Tool(unittest.TestCase):
             self.assertEqual([router["model"] for router in self.json("routers", *search)[1]["routers"]], models)
         self.expect("routers nothere", OK, "none of the 3 known routers matches")
         put("/etc/tavo/platform.conf", '[download]\ndatabase_url="http://127.0.0.1:1"\n[other]\n[download]\n')
-        put("/usr/tavo/bin/wget", "#!/bin/sh\nprintf 'no\\302\\233route\\342\\200\\256\\n' >&2\nexit 4\n")
-        os.chmod("/usr/tavo/bin/wget", 0o755)
+        program("/usr/tavo/bin/wget", r"printf 'no\302\233route\342\200\256\n' >&2; exit 4")
         self.expect("routers --update", FAILED, r"could not be updated, and the old ones stay: no\\u\{9b\}route\\u\{202e\}\n")
         os.unlink("/etc/tavo/platform.conf")
 

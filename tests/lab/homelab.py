@@ -23,6 +23,8 @@ PUBLIC = "198.41.0.4"  # what the daemon says its outside address is; it refuses
 STATUS = "/var/tmp/upnp_portmap.status"
 REMAP = "/var/tmp/natpmp_portmap.remap"
 DAEMONS = ("upnpd", "natpmpd")
+TOOL = f"{BUILD}/cli/tavoportmap"
+LAB = None  # also of each file of tests, once its cases begin
 
 NFT = """
 table inet home {
@@ -269,7 +271,9 @@ class Lab:
 
     def stop_router(self):
         """Without a word to anybody, as when the power goes."""
-        self.end(self.router)
+        if self.router is not None:
+            self.end(self.router)
+        self.router = None
         for chain in ("miniupnpd", "prerouting_miniupnpd", "postrouting_miniupnpd"):
             self.run("router", f"nft flush chain inet home {chain}")
 
@@ -406,6 +410,15 @@ class Lab:
             return dict(line.rstrip("\n").split("=", 1) for line in file)
 
 
+class Case(unittest.TestCase):
+    """Leaves nothing of a router and of a daemon."""
+
+    def tearDown(self):
+        LAB.stop_daemon(signal.SIGKILL)
+        LAB.stop_router()
+        LAB.clear_state()
+
+
 def only_box(mappings):
     return {key: port for key, (host, port) in mappings.items() if host == BOX}
 
@@ -419,10 +432,11 @@ def in_lab(main):
 
 
 def run_tests(tests):
-    """Runs the cases of the calling file, which find the lab as LAB, as tests(lab) prepares them, and prints a
-    summary."""
+    """Runs the cases of the calling file, as tests(lab) prepares them, and prints a summary."""
     def main(lab):
-        sys.modules["__main__"].LAB = lab
+        for module in list(sys.modules.values()):
+            if "LAB" in vars(module):
+                module.LAB = lab
         tests(lab)
         result = unittest.main(exit=False, verbosity=2, warnings="ignore").result
         failed = min(result.testsRun, len(result.failures) + len(result.errors))

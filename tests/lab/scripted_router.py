@@ -20,8 +20,6 @@ PORT = int(sys.argv[2]) if len(sys.argv) > 2 else 5000
 ADDRESS = sys.argv[3] if len(sys.argv) > 3 else "192.168.77.1"
 SERVICE = f"urn:schemas-upnp-org:service:WANIPConnection:{2 if FAULT == 'dies_of_ranges' else 1}"
 TABLE, COUNT, ASKED_402 = {}, {}, set()
-if FAULT == "slow_table":
-    TABLE.update({("UDP", port): (FOREIGN, port, 0, "theirs") for port in range(1, 25)})
 if FAULT == "conflict_foreign":
     TABLE[("TCP", 5001)] = (FOREIGN, 5001, 0, "theirs")
 
@@ -82,7 +80,6 @@ def add(key, client, port, lease, text):
         return fault(501)
     if FAULT == "says_full_at_32" and len(TABLE) >= 32:
         return fault(728)
-    text = "upnp" if FAULT == "rewrites" else text
     if not (FAULT == "full_at_32" and len(TABLE) >= 32) and FAULT != "keeps_nothing":
         TABLE[key] = (client, port, min(lease, 60) if FAULT == "lease_cut" else lease, text)
     return answer("AddPortMapping")
@@ -92,8 +89,6 @@ def act(action, args):
     key = (args.get("NewProtocol", ""), int(args.get("NewExternalPort") or 0))
     if action == "GetGenericPortMappingEntry":
         index = int(args["NewPortMappingIndex"])
-        if FAULT == "slow_table":
-            time.sleep(1.5)
         if FAULT == "endless_table":
             return answer(action, **{**entry(("TCP", 1)), "NewExternalPort": 7})
         return answer(action, **entry(sorted(TABLE)[index])) if index < len(TABLE) else fault(713)

@@ -9,9 +9,8 @@ import time
 
 import homelab
 import networks
-from homelab import BOX, BUILD, LAN2, WAN, wait_for
+from homelab import BOX, BUILD, LAN2, TOOL, WAN, wait_for
 
-TOOL = f"{BUILD}/cli/tavoportmap"
 CHECKD = f"{BUILD}/programs/tavoportcheckd"
 TOKEN, CHECK_PORT = "0123456789abcdef-story", 8099
 FOREIGN = {("tcp", 5001): (LAN2, 5001), ("tcp", 9999): (LAN2, 9999)}

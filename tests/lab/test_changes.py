@@ -167,15 +167,6 @@ class ScriptedRouter(Story):
         self.assertEqual(row()["state"], "open")
         self.assertFalse(os.path.exists("/tmp/harm"))
 
-    def test_a_port_that_flaps_is_told_of_a_few_times(self):
-        for i in range(6):
-            for what, state in ((f"take?5001,{LAN2},game", "refused"), ("take?5001", "open")):
-                self.tell_router(what)
-                wait_for(lambda: row()["state"] == state, 10, state)
-        lost = ("port-lost", f"{re.escape(PORT)}: .*")
-        self.told(lost, ("port-back", re.escape(PORT)), lost,
-                  ("port-back", re.escape(PORT) + r" \(it changes often, .*\)"))
-
     def test_the_outside_address_changes(self):
         self.assertEqual(published()["outside"], PUBLIC)
         self.tell_router("outside?0.0.0.0")

@@ -7,13 +7,12 @@ import unittest
 
 import homelab
 import test_reach
-from homelab import BOX, BUILD, LAN2, wait_for
+from homelab import BOX, BUILD, LAN2, TOOL, wait_for
 
 LAB = None
 USER_DB = "/etc/portforward/router_upnp.db.user"
 FILES = ("/tmp/upnp_test.progress", "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule")
 RULES = "/var/lib/tavo/upnp_test.conf"
-TOOL = f"{BUILD}/cli/tavoportmap"
 
 
 def start(*arguments):
@@ -38,9 +37,7 @@ class Compat(unittest.TestCase):
         LAB.stop_daemon(signal.SIGKILL)
         for pid in test_daemon():
             os.kill(pid, signal.SIGKILL)
-        if LAB.router is not None:
-            LAB.stop_router()
-        LAB.router = None
+        LAB.stop_router()
 
     def ended(self, seconds=3):
         wait_for(lambda: not test_daemon(), seconds, "the test daemon has ended")
@@ -189,11 +186,5 @@ class Compat(unittest.TestCase):
         self.assertEqual(LAB.scripted()["table"], [])
 
 
-def prepare(lab):
-    global LAB
-    LAB = test_reach.LAB = lab
-    lab.serve(5001, 5002)
-
-
 if __name__ == "__main__":
-    homelab.run_tests(prepare)
+    homelab.run_tests(lambda lab: lab.serve(5001, 5002))

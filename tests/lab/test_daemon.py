@@ -5,7 +5,6 @@ import os
 import re
 import signal
 import subprocess
-import unittest
 
 import homelab
 from homelab import BOX, HERE, wait_for
@@ -19,17 +18,12 @@ def option(*options):
     return LAB.run("box", " ".join((DAEMON, *options)), check=False).returncode
 
 
-class Daemon(unittest.TestCase):
+class Daemon(homelab.Case):
     def setUp(self):
         LAB.install()
         LAB.start_router()
         self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
         self.assertEqual(LAB.mappings(), MAPPED)
-
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.stop_router()
-        LAB.clear_state()
 
     def crash(self):
         pid = LAB.daemon_pid()

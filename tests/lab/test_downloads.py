@@ -181,8 +181,6 @@ class Downloads(unittest.TestCase):
 
 
 def prepare(lab):
-    global LAB
-    LAB = lab
     lab.start("wan", "/usr/bin/python3", f"{HERE}/file_server.py", SERVED, "8000", stderr=subprocess.DEVNULL)
     wait_for(lambda: lab.run("box", f"curl -s http://{WAN}:8000/", check=False).returncode == 0, 10, "the server is up")
 

@@ -13,10 +13,9 @@ import unittest
 
 import homelab
 import networks
-from homelab import BUILD, GATEWAY, LAN2, sh, wait_for
+from homelab import GATEWAY, LAN2, TOOL, sh, wait_for
 
 LAB = OUTSIDE = None
-TOOL = f"{BUILD}/cli/tavoportmap"
 CONF = "/etc/portforward"
 OK, USAGE, AWAY = 0, 2, 6
 # What a hint leaves for the user to fill in; the model is the one that is described in the lab.
@@ -70,9 +69,7 @@ class Hints(unittest.TestCase):
             undo()
         self.keep = []
         LAB.stop_daemon(signal.SIGKILL)
-        if LAB.router is not None:
-            LAB.stop_router()
-        LAB.router = None
+        LAB.stop_router()
         LAB.clear_state("/etc/tavoinfo.conf", "/var/lib/tavo/run_keys.conf", *(f"{CONF}/{name}" for name in os.listdir(CONF)))
         shutil.rmtree("/etc.defaults/portforward/routerdb", ignore_errors=True)
         LAB.install()
@@ -315,8 +312,8 @@ class Rule(unittest.TestCase):
 
 
 def prepare(lab):
-    global LAB, OUTSIDE
-    LAB, OUTSIDE = lab, networks.Outside(lab, avahi=False)
+    global OUTSIDE
+    OUTSIDE = networks.Outside(lab, avahi=False)
 
 
 if __name__ == "__main__":

@@ -10,10 +10,9 @@ import unittest
 
 import homelab
 import networks
-from homelab import BOX, BUILD, GATEWAY, sh, wait_for
+from homelab import BOX, GATEWAY, TOOL, sh, wait_for
 
 LAB = OUTSIDE = None
-TOOL = f"{BUILD}/cli/tavoportmap"
 KEYS, RECORD = "/etc/tavoinfo.conf", "/var/lib/tavo/run_keys.conf"
 RULES, DATABASE = "/etc/portforward/rule.conf", "/etc/portforward/router_upnp.db"
 OPEN = {("tcp", 5001): (BOX, 5001)}
@@ -43,6 +42,8 @@ def is_free():
 
 
 @contextlib.contextmanager
+
+
 def little_space(path):
     """The directory with what it holds, on a file system that is full."""
     copy = subprocess.run(["tar", "-cC", path, "."], check=False, capture_output=True).stdout  # not what nobody may read
@@ -108,7 +109,7 @@ class Keys(unittest.TestCase):
                 if code is not None:
                     self.assertEqual(run.returncode, code, run.stdout + run.stderr)
                 LAB.install(natpmp=way == "natpmpd")
-                if not LAB.router.poll() is None:
+                if LAB.router is None:
                     LAB.start_router()
                 self.restart(way)
                 self.tearDown()

@@ -1,9 +1,7 @@
 """Rules saved on the box, a real router, and a stranger outside who tries to connect."""
-import fcntl
 import os
 import signal
 import time
-import unittest
 
 import homelab
 from homelab import BOX, GATEWAY, LAN2, only_box, wait_for
@@ -11,17 +9,12 @@ from homelab import BOX, GATEWAY, LAN2, only_box, wait_for
 LAB = None
 
 
-class RealRouter(unittest.TestCase):
+class RealRouter(homelab.Case):
     flavours = (False, True)
 
     def setUp(self):
         LAB.install()
         LAB.start_router()
-
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.stop_router()
-        LAB.clear_state()
 
     def test_three_saves_in_a_row(self):
         steps = (
@@ -55,90 +48,6 @@ class RealRouter(unittest.TestCase):
         self.assertIn("0x13100022 The router already uses these ports for something else: 5001/tcp",
                       LAB.read("/var/log/tavo/event.log"))
 
-    def test_of_two_rules_for_a_port_the_second_is_reported_unless_it_asks_for_the_same(self):
-        answer = LAB.save("1,1,tcp,5001,5001", "2,1,all,5001,5002", "3,1,tcp,5001,5001", "4,0,tcp,5001,5003")
-        self.assertEqual((answer["status"], answer["ports"]), (9, "5001/tcp (service 2)"))
-        self.assertEqual(LAB.status()["5001/tcp (service 2)"], "duplicate")
-        self.assertEqual(LAB.mappings(), {("tcp", 5001): (BOX, 5001), ("udp", 5001): (BOX, 5002)})
-
-    def test_rules_that_cannot_be_paired_are_reported_and_the_others_mapped(self):
-        answer = LAB.save("1,1,tcp,5001-5003,5001-5002", "2,1,tcp,5004,5004", "3,1,tcp,99999,1")
-        self.assertEqual((answer["status"], answer["ports"]), (9, "5001-5003/tcp, 99999/tcp"))
-        self.assertEqual(LAB.mappings(), {("tcp", 5004): (BOX, 5004)})
-
-    def test_more_rules_than_the_database_allows(self):
-        LAB.write("/etc/portforward/router_upnp.db", '[Lab/One/1]\nmax="2"\n')
-        LAB.save("1,1,tcp,5001,5001")
-        before = LAB.read("/etc/portforward/rule.conf")
-        answer = LAB.save(*(f"{i},1,tcp,{5000 + i},{5000 + i}" for i in range(1, 4)))
-        self.assertEqual((answer["result"], answer["status"], answer["limit"]), (-1, 7, 2))
-        self.assertEqual(LAB.read("/etc/portforward/rule.conf"), before)
-
-    def test_stop_takes_the_mappings_away(self):
-        LAB.map_foreign(9999)
-        LAB.save("1,1,tcp,5001,5001")
-        LAB.stop_daemon(signal.SIGTERM)
-        self.assertEqual(LAB.mappings(), {("tcp", 9999): (LAN2, 9999)})
-        self.assertFalse(os.path.exists("/var/run/upnpd.pid"))
-
-    def test_killed_daemon_and_rebooted_router(self):
-        LAB.settings(check_interval=1)
-        LAB.save("1,1,tcp,5001,5001")
-        LAB.stop_daemon(signal.SIGKILL)
-        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
-        wanted = {("tcp", 5001): (BOX, 5001)}
-        self.assertEqual(LAB.mappings(), wanted)
-        LAB.stop_router()
-        self.assertEqual(LAB.mappings(), {})
-        LAB.start_router(port=5555)
-        wait_for(lambda: LAB.mappings() == wanted, 30, "the mapping is back after the reboot")
-
-    def test_saver_killed_in_mid_save_leaves_whole_rules(self):
-        LAB.save("1,1,tcp,5001,5001")
-        for polls in range(0, 60, 6):
-            saver = LAB.start_save(*(f"{i},1,tcp,{5000 + i},{5000 + i}" for i in range(1, 20)))
-            end = polls
-            while end and saver.poll() is None:
-                end -= 1
-                wait_for(lambda: True, 1, "a moment")
-                os.sched_yield()
-            LAB.end(saver)
-            text = LAB.read("/etc/portforward/rule.conf")
-            self.assertIn(text.count("["), (1, 19), text)
-            self.assertEqual(text.count("service="), text.count("["))
-        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["result"], 0)
-        self.assertEqual(LAB.mappings(), {("tcp", 5001): (BOX, 5001)})
-
-    def test_two_savers_and_the_lock_afterwards(self):
-        LAB.stop_router()  # the first save has to look for the router for a while
-        first = LAB.start_save("1,1,tcp,5001,5001")
-        def is_locked():
-            with open("/tmp/routerconf.lock", "a", encoding="ascii") as file:
-                try:
-                    fcntl.flock(file, fcntl.LOCK_EX | fcntl.LOCK_NB)
-                    return False
-                except OSError:
-                    return True
-        wait_for(is_locked, 5, "the first saver holds the lock")
-        answer = LAB.save("2,1,tcp,5002,5002", seconds=2)
-        self.assertEqual((answer["result"], answer["status"], answer["progress"]), (-1, 2, [20]))
-        first.communicate(timeout=60)
-        self.assertTrue(LAB.daemon_pid())
-        self.assertFalse(is_locked())
-        LAB.start_router()
-
-
-class NoRouter(unittest.TestCase):
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-
-    def test_gateway_without_upnp(self):
-        LAB.install()
-        answer = LAB.save("1,1,tcp,5001,5001", seconds=60)
-        self.assertEqual((answer["result"], answer["status"], answer["ports"]), (-1, 9, "5001/tcp"))
-        self.assertEqual(LAB.status(), {"5001/tcp": "noigd"})
-        self.assertIn('r_port="5001"', LAB.read("/etc/portforward/rule.conf"))
-
     def test_unreadable_rule_and_router_files_are_kept(self):
         LAB.write("/etc/portforward/router.conf", "this is no router file\n")
         answer = LAB.save("1,1,tcp,5001,5001")
@@ -146,7 +55,7 @@ class NoRouter(unittest.TestCase):
         self.assertEqual(LAB.read("/etc/portforward/router.conf"), "this is no router file\n")
 
 
-class FaultyRouter(unittest.TestCase):
+class FaultyRouter(homelab.Case):
     """Each fault: the ports saved, status, refused ports, why, entries of the box, and a bound in seconds."""
     one, many = range(5001, 5002), range(5001, 5041)
     table = (
@@ -176,15 +85,6 @@ class FaultyRouter(unittest.TestCase):
         ("location_loopback", one, 0, "", {"5001/tcp": "1"}, 1, 25),
     )
 
-    def tearDown(self):
-        self.clean()
-
-    @staticmethod
-    def clean():
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.end(LAB.router)
-        LAB.clear_state()
-
     def test_faults(self):
         for fault, ports, status, refused, why, entries, bound in self.table:
             with self.subTest(fault=fault):
@@ -210,7 +110,7 @@ class FaultyRouter(unittest.TestCase):
                     if fault == "bad_descriptions":  # each was tried, and none kept the good one from being found
                         self.assertGreaterEqual(sum(path.startswith("/") for path in state["count"]), 12)
                 finally:
-                    self.clean()
+                    self.tearDown()
 
     def test_a_stop_goes_on_while_the_router_answers(self):
         LAB.install()
@@ -232,7 +132,7 @@ class FaultyRouter(unittest.TestCase):
                 LAB.stop_daemon(signal.SIGTERM)
                 self.assertLess(time.monotonic() - start, 12)
                 self.assertEqual(len(LAB.scripted()["table"]), left)
-                self.clean()
+                self.tearDown()
 
 
 if __name__ == "__main__":

@@ -14,15 +14,10 @@ LAB = None
 MADE = "/var/lib/tavo/natpmp_made.conf"
 
 
-class RealRouter(unittest.TestCase):
+class RealRouter(homelab.Case):
     def setUp(self):
         LAB.install(natpmp=True)
         LAB.start_router()
-
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.stop_router()
-        LAB.clear_state()
 
     def owners(self):
         """Who made the mappings of the box, by the descriptions that the router keeps."""

@@ -6,10 +6,9 @@ import subprocess
 import unittest
 
 import homelab
-from homelab import BOX, BUILD, LAN2, only_box, wait_for
+from homelab import BOX, LAN2, TOOL, only_box, wait_for
 
 LAB = None
-TOOL = f"{BUILD}/cli/tavoportmap"
 OK, FAILED, REFUSED, AWAY = 0, 1, 4, 6
 STATE = ("/etc/tavoinfo.conf", "/var/lib/tavo/run_keys.conf", "/etc/portforward/rule.conf.draft",
          "/etc/portforward/rules.off")
@@ -22,8 +21,7 @@ class Case(unittest.TestCase):
 
     def tearDown(self):
         LAB.stop_daemon(signal.SIGKILL)
-        if LAB.router:
-            LAB.end(LAB.router)
+        LAB.stop_router()
         LAB.clear_state(*STATE)
 
     def tool(self, command, code=OK, pattern="."):
@@ -40,10 +38,6 @@ class RealRouter(Case):
     def setUp(self):
         super().setUp()
         LAB.start_router()
-
-    def tearDown(self):
-        LAB.stop_router()
-        super().tearDown()
 
     def test_one_command_each(self):
         for command, pattern, wanted in (

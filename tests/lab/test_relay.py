@@ -1,5 +1,4 @@
 """A service's ports between the user's rules and another host's mappings, from the request to the stranger."""
-import fcntl
 import json
 import os
 import signal
@@ -18,6 +17,8 @@ RELOADS = "/tmp/relay.reloads"
 # The relay service: reads its settings again on a signal, which is all that it does here.
 DAEMON = f"""
 import os, signal
+
+
 def reload(*_):
     with open('{RELOADS}', 'a') as file:
         file.write('reload\\n')
@@ -104,36 +105,8 @@ class Relay(unittest.TestCase):
         self.assertTrue(LAB.reaches("tcp", 8080) and not LAB.reaches("tcp", 5004))
         self.reloaded(3)
 
-    def test_what_the_user_switched_off_stays_off(self):
-        off = ("0", "tcp", "5002,6001", "5002,6001", "hoplink", "HopLink")
-        self.stored(off, *self.users, ("1", "tcp", "6002", "6002", "hoplink", "HopLink"))
-        self.assertEqual(self.set("5002,5004/tcp")["result"], 0)
-        self.kept(("0", "tcp", "5002", "5002", "hoplink", "HopLink"), *self.users,
-                  ("1", "tcp", "5004", "5004", "hoplink", "HopLink"))
-        self.mapped(("tcp", 5004))
-        self.assertFalse(LAB.reaches("tcp", 5002))
-        self.assertEqual(self.set()["result"], 0)
-        self.kept(*self.users)
-        self.mapped()
-
-    def test_what_is_refused_changes_nothing(self):
-        self.assertEqual(self.set("5002/tcp")["result"], 0)
-        self.reloaded(1)
-        before = LAB.read(RULES)
-        self.assertEqual(self.set("5004/tcp", "5001/tcp")["result"], -1)  # half of a rule of the user's
-        with open("/tmp/routerconf.lock", "w", encoding="ascii") as file:
-            fcntl.flock(file, fcntl.LOCK_EX)
-            self.assertEqual(self.set("5004/tcp")["result"], 2)
-        os.unlink("/etc/portforward/router.conf")
-        self.assertEqual(self.set("5004/tcp")["result"], 1)
-        self.assertEqual(LAB.read(RULES), before)
-        self.mapped(("tcp", 5002))
-        self.reloaded(1)
-
 
 def prepare(lab):
-    global LAB
-    LAB = test_reach.LAB = lab
     lab.write("/etc/init.d/tavorelayd", INIT)
     os.chmod("/etc/init.d/tavorelayd", 0o755)
     lab.serve(5001, 5002, 5003, 5004, 5005, 6000)

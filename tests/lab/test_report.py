@@ -3,7 +3,6 @@ import glob
 import hashlib
 import json
 import os
-import re
 import shutil
 import signal
 import tarfile
@@ -145,22 +144,8 @@ class Report(unittest.TestCase):
         send_to(PORT)
         self.received(self.report(True))
 
-    def test_a_brand_that_means_harm(self):
-        LAB.start_scripted("hostile_brand")
-        self.assertEqual(compat("known"), 0)
-        self.pretend_a_test()
-        before = {"routerconf.lock", *os.listdir("/tmp")}
-        name = self.report(True)
-        self.assertRegex(name, r"^/tmp/x__ _192\.168\.1\.1_[A-Za-z0-9 ._+()-]*_\d+\.tgz$")
-        self.assertEqual(set(os.listdir("/tmp")) - before, {os.path.basename(name)})
-        settings = self.received(name)[0]
-        self.assertEqual(re.findall(r"(?m)^\[.*", settings), [f"[{GATEWAY}]"])
-        self.assertEqual(re.findall(r"(?m)^user=.*", settings), [])
-
 
 def prepare(lab):
-    global LAB
-    LAB = test_compat.LAB = lab
     lab.write("/tmp/report_server.conf", SERVER)
     lab.start("wan", "/usr/sbin/lighttpd", "-D", "-f", "/tmp/report_server.conf")
     wait_for(lambda: lab.run("wan", f"ss -Hltn sport = :{PORT}").stdout, 10, "the server is up")

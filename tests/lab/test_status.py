@@ -2,13 +2,11 @@
 import json
 import re
 import signal
-import unittest
 
 import homelab
-from homelab import BUILD, HERE, LAN2, PUBLIC, wait_for
+from homelab import HERE, LAN2, PUBLIC, TOOL, wait_for
 
 LAB = None
-TOOL = f"{BUILD}/cli/tavoportmap"
 OK, REFUSED, AWAY = 0, 4, 6
 
 
@@ -22,16 +20,10 @@ def wait_until(code, what, *arguments):
     return wait_for(lambda: (told := status(*arguments))[0] == code and told[1], 30, what)
 
 
-class Status(unittest.TestCase):
+class Status(homelab.Case):
     def setUp(self):
         LAB.install()
         LAB.settings(check_interval=1)
-
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.stop_router()
-        LAB.clear_state()
-        LAB.settings()
 
     def test_it_says_what_the_router_does(self):
         LAB.start_router()

@@ -3,7 +3,6 @@ import json
 import os
 import signal
 import time
-import unittest
 
 import homelab
 from homelab import BOX, GATEWAY, sh, wait_for
@@ -22,15 +21,10 @@ def own_address(new, old):
        f"ip -n box route replace default via {GATEWAY}")
 
 
-class World(unittest.TestCase):
+class World(homelab.Case):
     def setUp(self):
         LAB.install()
         LAB.settings(check_interval=1, lease=20)
-
-    def tearDown(self):
-        LAB.stop_daemon(signal.SIGKILL)
-        LAB.end(LAB.router)
-        LAB.clear_state()
 
     def test_the_box_has_another_address(self):
         """A router that lets nobody else delete an entry keeps the old one until its lease ends, and that is said."""
@@ -55,7 +49,6 @@ class World(unittest.TestCase):
                     own_address(BOX, NEW)
                 self.tearDown()
                 self.setUp()
-        LAB.start_router()
 
     def test_the_box_has_two_addresses(self):
         """As on cable and Wi-Fi: the way out is another one, and the one of before is still there to ask from."""
@@ -161,15 +154,6 @@ class World(unittest.TestCase):
             self.assertIn('router_port="5009"', LAB.read(made))
             sh("ip -n box neigh flush dev box0")
             time.sleep(1.5)
-
-    def test_what_a_router_without_upnp_may_still_forward_is_named(self):
-        LAB.settings(check_interval=1)
-        LAB.start_router()
-        self.assertEqual(LAB.save("1,1,tcp,5001,5001")["status"], 0)
-        LAB.end(LAB.router)
-        LAB.save()
-        wait_for(lambda: state()["left_over"] != [], 30,
-                 "what no rule asks for any more is named")
 
     def test_rules_go_with_the_old_address_gone(self):
         LAB.start_router(secure=False)

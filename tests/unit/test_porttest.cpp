@@ -146,6 +146,7 @@ TEST(Checker, IsAskedAndItsAnswerReadOrTheReasonGiven) {
         {fnAnswer(503), "t", 0, "is busy"},
         {fnAnswer(500), "t", 0, "(HTTP 500)"},
         {fnAnswer(201), "t", 0, "(HTTP 201)"},
+        {"HTTP/1.1 302 x\r\nLocation: http://127.0.0.1/\r\nContent-Length: 0\r\n\r\n", "t", 0, "(HTTP 302)"},
         {"hello\r\n", "t", 0, "did not answer as one"},
         {"", "t", 0, "did not answer in time"},
         {"", "t\n", 0, "url or token cannot be used"},

@@ -161,7 +161,7 @@ std::string KeptTest() {
 }
 
 bool KeepKnown(const char* szLocation) {
-    tavo::KeepRouter("192.168.1.1", {szLocation, false});
+    tavo::KeepRouter("192.168.1.1", {{szLocation, ""}});
     return true;
 }
 
@@ -300,7 +300,7 @@ const std::vector<Store>& Stores() {
          TakeOverJobs, KeptJobs, "earlier", "12"},
         Plain("a test's mappings", KeepTest, KeptTest, "old", "new"),
         Plain(
-            "a known router", KeepKnown, [] { return tavo::RecallRouter("192.168.1.1").szLocation; }, "old", "new", "",
+            "a known router", KeepKnown, [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old", "new", "",
             true),
         Plain("a task", StoreTask, StoredTask, "old", "new"),
         Plain("the first task", StoreTask, StoredTask, kNone, "new"),
