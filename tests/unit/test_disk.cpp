@@ -463,14 +463,12 @@ std::string At(int fdDir, const char* szPath) {
 }  // namespace
 
 extern "C" {
-
 int open(const char* szPath, int nFlags, ...) {
     va_list args;
     va_start(args, nFlags);
     const mode_t nMode = (nFlags & (O_CREAT | O_TMPFILE)) != 0 ? va_arg(args, mode_t) : 0;
     va_end(args);
-    static const auto fnReal = Real("open", &open);
-    return Told(fnReal(szPath, nFlags, nMode), [&] {
+    return Told(Real("open", &open)(szPath, nFlags, nMode), [&] {
         if ((nFlags & O_CREAT) != 0) {
             Recorder::Made(szPath);
         }
@@ -479,90 +477,62 @@ int open(const char* szPath, int nFlags, ...) {
         }
     });
 }
-
 ssize_t write(int fd, const void* pData, size_t nSize) {
-    static const auto fnReal = Real("write", &write);
-    const ssize_t nWritten = fnReal(fd, pData, nSize);
+    const ssize_t nWritten = Real("write", &write)(fd, pData, nSize);
     Told(nWritten < 0 ? -1 : 0, [&] { Recorder::Changed(PathOf(fd), "write"); });
     return nWritten;
 }
-
 int ftruncate(int fd, off_t nSize) noexcept {
-    static const auto fnReal = Real("ftruncate", &ftruncate);
-    return Told(fnReal(fd, nSize), [&] { Recorder::Changed(PathOf(fd), "truncate"); });
+    return Told(Real("ftruncate", &ftruncate)(fd, nSize), [&] { Recorder::Changed(PathOf(fd), "truncate"); });
 }
-
 int fchmod(int fd, mode_t nMode) noexcept {
-    static const auto fnReal = Real("fchmod", &fchmod);
-    return Told(fnReal(fd, nMode), [&] { Recorder::Changed(PathOf(fd), "chmod"); });
+    return Told(Real("fchmod", &fchmod)(fd, nMode), [&] { Recorder::Changed(PathOf(fd), "chmod"); });
 }
-
 int chmod(const char* szPath, mode_t nMode) noexcept {
-    static const auto fnReal = Real("chmod", &chmod);
-    return Told(fnReal(szPath, nMode), [&] { Recorder::Changed(szPath, "chmod"); });
+    return Told(Real("chmod", &chmod)(szPath, nMode), [&] { Recorder::Changed(szPath, "chmod"); });
 }
-
 int fchown(int fd, uid_t nUser, gid_t nGroup) noexcept {
-    static const auto fnReal = Real("fchown", &fchown);
-    return Told(fnReal(fd, nUser, nGroup), [&] { Recorder::Changed(PathOf(fd), "chown"); });
+    return Told(Real("fchown", &fchown)(fd, nUser, nGroup), [&] { Recorder::Changed(PathOf(fd), "chown"); });
 }
-
 int chown(const char* szPath, uid_t nUser, gid_t nGroup) noexcept {
-    static const auto fnReal = Real("chown", &chown);
-    return Told(fnReal(szPath, nUser, nGroup), [&] { Recorder::Changed(szPath, "chown"); });
+    return Told(Real("chown", &chown)(szPath, nUser, nGroup), [&] { Recorder::Changed(szPath, "chown"); });
 }
-
 int fsync(int fd) {
     struct stat status = {};
     if (gBlDirectoriesFail && fstat(fd, &status) == 0 && S_ISDIR(status.st_mode)) {
         errno = EIO;
         return -1;
     }
-    static const auto fnReal = Real("fsync", &fsync);
-    return Told(fnReal(fd), [&] { Recorder::Flushed(fd, false); });
+    return Told(Real("fsync", &fsync)(fd), [&] { Recorder::Flushed(fd, false); });
 }
-
 int fdatasync(int fd) {
-    static const auto fnReal = Real("fdatasync", &fdatasync);
-    return Told(fnReal(fd), [&] { Recorder::Flushed(fd, false); });
+    return Told(Real("fdatasync", &fdatasync)(fd), [&] { Recorder::Flushed(fd, false); });
 }
-
 int syncfs(int fd) noexcept {
-    static const auto fnReal = Real("syncfs", &syncfs);
-    return Told(fnReal(fd), [&] { Recorder::Flushed(fd, true); });
+    return Told(Real("syncfs", &syncfs)(fd), [&] { Recorder::Flushed(fd, true); });
 }
-
 int unlink(const char* szPath) noexcept {
     ChangeName();
-    static const auto fnReal = Real("unlink", &unlink);
-    return Told(fnReal(szPath), [&] { Recorder::Names("unlink", {szPath}); });
+    return Told(Real("unlink", &unlink)(szPath), [&] { Recorder::Names("unlink", {szPath}); });
 }
-
 int remove(const char* szPath) noexcept {
-    static const auto fnReal = Real("remove", &remove);
-    return Told(fnReal(szPath), [&] { Recorder::Names("unlink", {szPath}); });
+    return Told(Real("remove", &remove)(szPath), [&] { Recorder::Names("unlink", {szPath}); });
 }
-
 int rmdir(const char* szPath) noexcept {
-    static const auto fnReal = Real("rmdir", &rmdir);
-    return Told(fnReal(szPath), [&] { Recorder::Names("rmdir", {szPath}); });
+    return Told(Real("rmdir", &rmdir)(szPath), [&] { Recorder::Names("rmdir", {szPath}); });
 }
-
 int unlinkat(int fdDir, const char* szPath, int nFlags) noexcept {
-    static const auto fnReal = Real("unlinkat", &unlinkat);
-    return Told(fnReal(fdDir, szPath, nFlags), [&] { Recorder::Names("unlink", {At(fdDir, szPath)}); });
+    return Told(Real("unlinkat", &unlinkat)(fdDir, szPath, nFlags),
+                [&] { Recorder::Names("unlink", {At(fdDir, szPath)}); });
 }
-
 int rename(const char* szFrom, const char* szTo) noexcept {
     ChangeName();
     if (gSzFailRename == szFrom) {
         gSzFailRename.clear();
         return -1;
     }
-    static const auto fnReal = Real("rename", &rename);
-    return Told(fnReal(szFrom, szTo), [&] { Recorder::Names("rename", {szFrom, szTo}); });
+    return Told(Real("rename", &rename)(szFrom, szTo), [&] { Recorder::Names("rename", {szFrom, szTo}); });
 }
-
 int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsigned nFlags) noexcept {
     if (gNRenamesLeft >= 0 && gNRenamesLeft-- == 0) {
         raise(gBlKilled ? SIGKILL : 0);
@@ -573,44 +543,31 @@ int renameat2(int fdFrom, const char* szFrom, int fdTo, const char* szTo, unsign
         errno = EINVAL;
         return -1;
     }
-    static const auto fnReal = Real("renameat2", &renameat2);
-    return Told(fnReal(fdFrom, szFrom, fdTo, szTo, nFlags), [&] {
+    return Told(Real("renameat2", &renameat2)(fdFrom, szFrom, fdTo, szTo, nFlags), [&] {
         Recorder::Names("rename", {At(fdFrom, szFrom), At(fdTo, szTo)});
     });
 }
-
 int link(const char* szFrom, const char* szTo) noexcept {
-    static const auto fnReal = Real("link", &link);
-    return Told(fnReal(szFrom, szTo), [&] { Recorder::Names("link", {szTo}); });
+    return Told(Real("link", &link)(szFrom, szTo), [&] { Recorder::Names("link", {szTo}); });
 }
-
 int symlink(const char* szTarget, const char* szPath) noexcept {
-    static const auto fnReal = Real("symlink", &symlink);
-    return Told(fnReal(szTarget, szPath), [&] { Recorder::Made(szPath); });
+    return Told(Real("symlink", &symlink)(szTarget, szPath), [&] { Recorder::Made(szPath); });
 }
-
 int mkdir(const char* szPath, mode_t nMode) noexcept {
-    static const auto fnReal = Real("mkdir", &mkdir);
-    return Told(fnReal(szPath, nMode), [&] { Recorder::Made(szPath); });
+    return Told(Real("mkdir", &mkdir)(szPath, nMode), [&] { Recorder::Made(szPath); });
 }
-
 char* mkdtemp(char* szPath) noexcept {
-    static const auto fnReal = Real("mkdtemp", &mkdtemp);
-    char* szMade = fnReal(szPath);
+    char* szMade = Real("mkdtemp", &mkdtemp)(szPath);
     Told(szMade == nullptr ? -1 : 0, [&] { Recorder::Made(szPath); });
     return szMade;
 }
-
 int stat(const char* szPath, struct stat* pStatus) noexcept {
-    static const auto fnReal = Real("stat", static_cast<int (*)(const char*, struct stat*)>(&stat));
-    const int nResult = fnReal(szPath, pStatus);
+    const int nResult = Real("stat", static_cast<int (*)(const char*, struct stat*)>(&stat))(szPath, pStatus);
     Pretend(pStatus);
     return nResult;
 }
-
 int fstat(int fd, struct stat* pStatus) noexcept {
-    static const auto fnReal = Real("fstat", &fstat);
-    const int nResult = fnReal(fd, pStatus);
+    const int nResult = Real("fstat", &fstat)(fd, pStatus);
     std::error_code error;
     if (!gSzForeign.empty() && fs::read_symlink(PathOf(fd), error) == gSzForeign) {
         pStatus->st_uid = 1000;

@@ -32,51 +32,40 @@ void Put(const char* szStep, const std::string& szWord) {
     TLIBCFileSetKeyValue(kProgress, szStep, szWord.c_str(), nullptr);
 }
 
-// The tool has worked on a step.
-void Work(const char* szStep) {
-    const auto it = gPClient->mapWords.find(szStep);
-    Put(szStep, it == gPClient->mapWords.end() ? "finished" : it->second);
+// The tool has worked on these steps, and answers.
+int Worked(std::initializer_list<const char*> rgszSteps, const char* szCall, int nAnswer) {
+    for (const char* szStep : rgszSteps) {
+        const auto it = gPClient->mapWords.find(szStep);
+        Put(szStep, it == gPClient->mapWords.end() ? "finished" : it->second);
+    }
+    return gPClient->Call(szCall, nAnswer);
 }
 
 }  // namespace
 
 extern "C" {
 int TAVOUPnPAddTest(int nRules) {
-    if (gPClient == nullptr) {
-        return Real("TAVOUPnPAddTest", &TAVOUPnPAddTest)(nRules);
-    }
-    Work("upnp_add");
-    return gPClient->Call("add", nRules == gPClient->nWanted ? 0 : -1);
+    return gPClient == nullptr ? Real("TAVOUPnPAddTest", &TAVOUPnPAddTest)(nRules)
+                               : Worked({"upnp_add"}, "add", nRules == gPClient->nWanted ? 0 : -1);
 }
 int TAVOUPnPCountMaxRule() {
     return gPClient == nullptr ? Real("TAVOUPnPCountMaxRule", &TAVOUPnPCountMaxRule)() : gPClient->Call("count", 10);
 }
 int TAVOUPnPDeletetest() {
-    if (gPClient == nullptr) {
-        return Real("TAVOUPnPDeletetest", &TAVOUPnPDeletetest)();
-    }
-    Work("upnp_delete");
-    return gPClient->Call("delete", 0);
+    return gPClient == nullptr ? Real("TAVOUPnPDeletetest", &TAVOUPnPDeletetest)()
+                               : Worked({"upnp_delete"}, "delete", 0);
 }
 int TAVOUPnPSetupTest(int nLimit, int nFlags) {
-    if (gPClient == nullptr) {
-        return Real("TAVOUPnPSetupTest", &TAVOUPnPSetupTest)(nLimit, nFlags);
-    }
-    return gPClient->Call("setup", nLimit == 60 && nFlags == 0 ? 0 : -1);
+    return gPClient == nullptr ? Real("TAVOUPnPSetupTest", &TAVOUPnPSetupTest)(nLimit, nFlags)
+                               : gPClient->Call("setup", nLimit == 60 && nFlags == 0 ? 0 : -1);
 }
 int TAVOUPnPPortTest(int blAdded) {
-    if (gPClient == nullptr) {
-        return Real("TAVOUPnPPortTest", &TAVOUPnPPortTest)(blAdded);
-    }
-    return gPClient->Call(blAdded == 1 ? "open" : "closed", 0);
+    return gPClient == nullptr ? Real("TAVOUPnPPortTest", &TAVOUPnPPortTest)(blAdded)
+                               : gPClient->Call(blAdded == 1 ? "open" : "closed", 0);
 }
 int TAVOUPnPModifyRule() {
-    if (gPClient == nullptr) {
-        return Real("TAVOUPnPModifyRule", &TAVOUPnPModifyRule)();
-    }
-    Work("upnp_readd1");
-    Work("upnp_readd2");
-    return gPClient->Call("modify", 0);
+    return gPClient == nullptr ? Real("TAVOUPnPModifyRule", &TAVOUPnPModifyRule)()
+                               : Worked({"upnp_readd1", "upnp_readd2"}, "modify", 0);
 }
 int TAVOUpnpRemoveTestRulePath() {
     return gPClient == nullptr ? Real("TAVOUpnpRemoveTestRulePath", &TAVOUpnpRemoveTestRulePath)()

@@ -38,15 +38,12 @@ bool IsLockFree() {
 }  // namespace
 
 extern "C" {
-
 TLIBCSzHash* TLIBCSzHashAlloc(int nSize) {
     return Fails("hash") ? nullptr : Real("TLIBCSzHashAlloc", &TLIBCSzHashAlloc)(nSize);
 }
-
 int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szValue) {
     return Fails(szKey) ? -1 : Real("TLIBCSzHashSetValue", &TLIBCSzHashSetValue)(pHash, szKey, szValue);
 }
-
 int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szValue, const char* szFormat) {
     if (gStage.blOn) {
         const OwnMemory own;
@@ -55,25 +52,20 @@ int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szVa
     return Fails("run key") ? -1
                             : Real("TLIBCFileSetKeyValue", &TLIBCFileSetKeyValue)(szPath, szKey, szValue, szFormat);
 }
-
 int TLIBCFileGetSectionValue(const char* szPath, const char* szSection, const char* szKey, char* szValue, int nSize) {
     return Fails("look-up")
                ? -1
                : Real("TLIBCFileGetSectionValue", &TLIBCFileGetSectionValue)(szPath, szSection, szKey, szValue, nSize);
 }
-
 int TLIBCFileGetKeys(const char* szPath, const char* szPrefix, TLIBCSzHash** ppHash, const char* szSeparator) {
     return Fails("status") ? -1 : Real("TLIBCFileGetKeys", &TLIBCFileGetKeys)(szPath, szPrefix, ppHash, szSeparator);
 }
-
 int TLIBPFCountRuleConf(const TAVO_PF_CONF* pHead, int nEnabledOnly) {
     return Fails("count") ? -1 : Real("TLIBPFCountRuleConf", &TLIBPFCountRuleConf)(pHead, nEnabledOnly);
 }
-
 int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, const char* szJob) {
     return Fails(szJob) ? -1 : Real("TAVOPFCountJobNumber", &TAVOPFCountJobNumber)(pHead, szGwRouterIP, szJob);
 }
-
 int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
     if (gStage.blOn) {
         const OwnMemory own;
@@ -81,18 +73,15 @@ int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
     }
     return Fails("write") ? -1 : Real("TAVOPFRuleBuildByPath", &TAVOPFRuleBuildByPath)(pHead, szPath);
 }
-
 int NetpmpRemapGet(char** ppszRemap, int* pnSize) {
     if (gStage.blOn) {
         Tell("remap");
     }
     return Fails("remap") ? -1 : Real("NetpmpRemapGet", &NetpmpRemapGet)(ppszRemap, pnSize);
 }
-
 const char* GetRouterDBPath() {
     return gStage.blOn ? gStage.szLocation.c_str() : Real("GetRouterDBPath", &GetRouterDBPath)();
 }
-
 int TLIBCIsProcAlive(const char* szName) {
     if (!gStage.blOn) {
         return Real("TLIBCIsProcAlive", &TLIBCIsProcAlive)(szName);
@@ -100,7 +89,6 @@ int TLIBCIsProcAlive(const char* szName) {
     const OwnMemory own;
     return gStage.alive.contains(szName) ? 1 : 0;
 }
-
 int TLIBCKill(const char* szName, int nSignal) {
     if (!gStage.blOn) {
         return Real("TLIBCKill", &TLIBCKill)(szName, nSignal);
@@ -109,7 +97,6 @@ int TLIBCKill(const char* szName, int nSignal) {
     Tell("signal " + std::string(szName) + " " + std::to_string(nSignal));
     return 1;
 }
-
 int kill(pid_t pid, int nSignal) noexcept {
     if (!gStage.blOn || pid < 0) {
         return Real("kill", &kill)(pid, nSignal);
@@ -119,7 +106,6 @@ int kill(pid_t pid, int nSignal) noexcept {
     errno = ESRCH;
     return Fails("kill") ? -1 : 0;
 }
-
 int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const char* szArg3, const char* szArg4) {
     if (!gStage.blOn) {
         return Real("TLIBCExec", &TLIBCExec)(szPath, szArg1, szArg2, szArg3, szArg4);
@@ -134,7 +120,6 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
     }
     return 0;
 }
-
 int TLIBCSystem(const char* szCommand) {
     if (!gStage.blOn) {
         return Real("TLIBCSystem", &TLIBCSystem)(szCommand);
@@ -149,7 +134,6 @@ int TLIBCSystem(const char* szCommand) {
     }
     return 0;
 }
-
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4) {
     if (!gStage.blOn) {
@@ -162,7 +146,6 @@ int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, con
     Tell(line.str());
     return 0;
 }
-
 int TLIBServiceIsRunning(const char* szName) {
     if (!gStage.blOn) {
         return Real("TLIBServiceIsRunning", &TLIBServiceIsRunning)(szName);
@@ -171,7 +154,6 @@ int TLIBServiceIsRunning(const char* szName) {
     Tell("ask " + std::string(szName) + (IsLockFree() ? "" : ", still locked"));
     return gStage.blRelay ? 1 : 0;
 }
-
 int TLIBServiceReload(const char* szName) {
     if (!gStage.blOn) {
         return Real("TLIBServiceReload", &TLIBServiceReload)(szName);
