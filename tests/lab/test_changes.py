@@ -5,7 +5,6 @@ import re
 import shutil
 import signal
 import socket
-import stat
 import subprocess
 import threading
 import time
@@ -13,7 +12,7 @@ import unittest
 from urllib.parse import quote
 
 import homelab
-from homelab import BOX, BUILD, GATEWAY, HERE, LAN2, PUBLIC, sh, wait_for
+from homelab import BUILD, GATEWAY, HERE, LAN2, PUBLIC, sh, wait_for
 
 LAB = None
 JOURNAL = []  # (priority, program, text)
@@ -368,40 +367,6 @@ class Hooks(unittest.TestCase):
         wait_for(lambda: not any(os.path.exists(f"/proc/{pid}") for pid in pids), 45, "the hook is ended")
         wait_for(lambda: os.path.exists("/tmp/next"), 10, "the next one runs")
         self.assertEqual(LAB.read("/tmp/next"), "port-lost\n")
-
-
-class Published(unittest.TestCase):
-    """The state of the daemons, whole and true after each pass, and gone with them."""
-    rules = ("1,1,tcp,5001,5001", "2,1,udp,6001,5002", "3,1,tcp,5001,5003", "4,1,tcp,7001-7003,1-2")
-
-    def test_it_says_what_became_of_each_rule_and_of_the_router(self):
-        for daemon, protocol in (("upnpd", "UPnP"), ("natpmpd", "NAT-PMP")):
-            with self.subTest(daemon=daemon):
-                LAB.install(natpmp=daemon == "natpmpd")
-                LAB.start_router()
-                LAB.map_foreign(5001)
-                LAB.save(*self.rules)
-                state = wait_for(lambda: published(daemon), 5, "the state is there")
-                self.assertEqual((state["protocol"], state["pid"], state["switched_on"], state["gateway"], state["box"],
-                                  state["outside"], state["router"]),
-                                 (protocol, LAB.daemon_pid(daemon), True, GATEWAY, BOX, PUBLIC, "ok"))
-                self.assertLess(abs(state["at"] - time.time()), 60)
-                self.assertGreater(state["next_look"], state["at"])
-                rows = {(row["name"], row["rule"]): row for row in state["rules"]}
-                other = {"address": LAN2, "description": "libminiupnpc"} if daemon == "upnpd" else None
-                taken = rows["5001/tcp", "service 1"]
-                self.assertEqual((taken["state"], taken["holder"]), ("refused", other))
-                game = rows["6001/udp", "service 2"]
-                self.assertEqual((game["state"], game["word"], game["why"], game["protocol"], game["router_port"],
-                                  game["box_port"]), ("open", "1", None, "udp", 6001, 5002))
-                self.assertGreater(game["until"], state["at"])
-                self.assertEqual(rows["5001/tcp (service 3)", "service 3"]["word"], "duplicate")
-                self.assertEqual(rows["7001-7003/tcp", "service 4"]["router_port"], None)
-                path = f"/run/tavo/{daemon}.json"
-                self.assertEqual(stat.S_IMODE(os.stat(path).st_mode), 0o644)
-                LAB.stop_daemon(signal.SIGTERM)
-                self.assertIsNone(published(daemon))
-                LAB.stop_router()
 
 
 def prepare(lab):

@@ -97,21 +97,6 @@ class Compat(unittest.TestCase):
         LAB.start_scripted("keeps_nothing")
         self.assertEqual(run(10, "test"), {"result": 1, "status": 0, "support": "no", "max": -1})
 
-    def test_the_tool_learns_a_limit_and_saving_goes_by_it(self):
-        LAB.start_scripted("full_at_32")
-        LAB.write("/etc/portforward/router_upnp.db", "")
-        told = json.loads(LAB.run("box", f"{TOOL} --json compat --record").stdout)
-        self.assertEqual((told["passed"], told["max_rules"], told["recorded"]), (True, 32, True))
-        LAB.run("box", f"{TOOL} router set --brand {told['router']['brand']} --model Scripted --version 7")
-        LAB.write("/etc/portforward/rule.conf", "".join(
-            f'[{i}]\nenabled="1"\nprotocol name="tcp"\nr_port="{5000 + i}"\ns_port="5001"\n' for i in range(1, 34)))
-        refused = LAB.run("box", f"{TOOL} save", check=False)
-        self.assertEqual(refused.returncode, 5)
-        self.assertIn("the router holds 32 rules and there are 33", refused.stderr)
-        LAB.run("box", f"{TOOL} rules remove 33")
-        LAB.run("box", f"{TOOL} save")
-        self.assertEqual(len(LAB.scripted()["table"]), 32)
-
     def test_the_tool_that_is_interrupted_leaves_nothing(self):
         LAB.start_scripted("silent_adds_at_10")
         tool = LAB.start("box", TOOL, "compat", "--yes", stderr=subprocess.PIPE, text=True)

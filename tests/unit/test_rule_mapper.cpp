@@ -257,6 +257,7 @@ TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
     }
     EXPECT_EQ(Result(), "80/tcp 1\n1-2/tcp invalid\n");
     EXPECT_EQ(std::filesystem::status(kNames.szResultFile).permissions(), std::filesystem::perms(0644));
+    EXPECT_EQ(std::filesystem::status(kPublished).permissions(), std::filesystem::perms(0644));
     Json::Value js;
     std::istringstream(Read(kPublished)) >> js;
     EXPECT_EQ(js["rules"][0]["rule"].asString() + js["rules"][1]["rule"].asString(), "web2");
