@@ -169,6 +169,12 @@ TEST(Notices, WhatChangesAllTheTimeIsToldAFewTimesAndItsOutcomeInTheEnd) {
     EXPECT_EQ(story.Tell({.rgszPorts = {"80 728"}}), News{}) << "still too often";
     EXPECT_EQ(story.Tell({.rgszPorts = {"80 728"}, .nAfter = 3600}),
               News{"port-lost: 80/tcp (web): the router's table of ports is full"});
+    Story other;
+    size_t nTold = 0;
+    for (int i = 0; i < 9; ++i) {
+        nTold += other.Tell({.szOutside = i % 2 == 0 ? "198.51.100.1" : "198.51.100.2"}).size();
+    }
+    EXPECT_EQ(nTold, 4U) << "of an address alike";
 }
 
 // At the edges of the hour within which four are enough; a clock that was set back has told of nothing yet.
