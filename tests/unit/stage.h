@@ -2,6 +2,8 @@
 // played, chosen platform calls fail, and what happens is told in gLog, between the log lines.
 #pragma once
 
+#include <gtest/gtest.h>
+
 #include <functional>
 #include <set>
 #include <string>
@@ -17,6 +19,13 @@ struct Stage {
     std::function<void(const std::string&)> fnRun;  // what a command does
 };
 extern Stage gStage;
+
+// Begins and ends with nothing played: no stage, no network, the usual gateway, an empty log.
+class StagedTest : public testing::Test {
+protected:
+    void SetUp() override;
+    void TearDown() override { StagedTest::SetUp(); }
+};
 
 // A line of the story.
 void Tell(const std::string& szLine);

@@ -28,7 +28,7 @@ constexpr char kRouterConfBak[] = "/etc/portforward/router.conf.bak";
 constexpr char kTool[] = "/usr/tavo/bin/tavoportforward";
 constexpr char kAnnounced[] = "/tmp/airport.tcp.local";
 
-class Detection : public testing::Test {
+class Detection : public StagedTest {
 protected:
     void SetUp() override {
         MakeEmpty({"/etc/portforward", "/etc.defaults/portforward/routerdb", "/usr/tavo/bin"});
@@ -41,16 +41,8 @@ protected:
               "[Bad/R/1]\nsupport=yes\npfpath=../..: etc(x)\n");
         Write("/etc.defaults/portforward/routerdb/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
         SetTool("syntax version=1");
-        gLog.clear();
-        gSzGateway = "192.168.1.1";
-        gFnOnSleep = nullptr;
+        StagedTest::SetUp();
         gPNetwork = &mNetwork;
-    }
-    void TearDown() override {
-        gPNetwork = nullptr;
-        gFnOnSleep = nullptr;
-        gFnOnConfSet = nullptr;
-        gStage = {};
     }
     static void SetTool(const std::string& szLine) { WriteProgram(kTool, "echo '" + szLine + "'\n"); }
     Network mNetwork;

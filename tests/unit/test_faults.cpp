@@ -70,18 +70,11 @@ Lines Names() {
     return rgszNames;
 }
 
-class Faults : public testing::Test {
+class Faults : public StagedTest {
 protected:
     void SetUp() override {
-        std::filesystem::remove_all(kDir);
-        std::filesystem::create_directories(kDir);
-        gLog.clear();
-        gSzGateway = "192.168.1.1";
-    }
-    void TearDown() override {
-        gNClockAhead = 0;
-        gFnOnConfSet = nullptr;
-        gStage = {};
+        StagedTest::SetUp();
+        MakeEmpty({kDir});
     }
 };
 

@@ -43,17 +43,16 @@ constexpr const char* kNone = "nothing";
 constexpr char kBox[] = "192.168.1.2";
 const tavo::RouterName kRouter{"192.168.1.1", "aa:bb"};
 
-class PowerCuts : public testing::Test {
+class PowerCuts : public StagedTest {
 protected:
     void SetUp() override {
-        gSzGateway = "192.168.1.1";
+        StagedTest::SetUp();
         Write("/etc/portforward/router_upnp.db", "[Acme/R1/1.0]\nsupport=yes\nmax=32\n[Old//]\nmax=1\n");
         Write(std::string(kDatabase) + "/Acme/R1/1.0/router.des", "[global]\nsyntax version=1\n");
         WriteProgram(kTool, "echo 'syntax version=1'\n");
     }
     void TearDown() override {
-        gStage = {};
-        gFnOnSleep = nullptr;
+        StagedTest::TearDown();
         gBlDirectoriesFail = false;
         gBlExchanges = true;
     }

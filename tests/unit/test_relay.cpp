@@ -11,6 +11,7 @@
 #include "Text.h"
 #include "naive_conflicts.h"
 #include "src/merge/UsedPorts.h"
+#include "stage.h"
 #include "world.h"
 
 namespace {
@@ -19,10 +20,7 @@ using namespace tavo::lib;
 using Ports = PortList;
 using Lines = std::vector<std::string>;
 
-class Relay : public testing::Test {
-protected:
-    void SetUp() override { gLog.clear(); }
-};
+using Relay = StagedTest;
 
 // ---- port lists ---------------------------------------------------------------------------------------
 

@@ -8,6 +8,7 @@
 #include "RouterConflicts.h"
 #include "Text.h"
 #include "network.h"
+#include "stage.h"
 #include "world.h"
 
 Home* gPHome = nullptr;
@@ -74,7 +75,7 @@ namespace {
 
 using namespace tavo::lib;
 
-class RelayRouter : public testing::Test {
+class RelayRouter : public StagedTest {
 protected:
     void SetUp() override {
         std::filesystem::remove_all("/etc/portforward");
@@ -84,15 +85,9 @@ protected:
         mHome.mappings = {{5000, 80, "TCP", "192.168.1.9", "", 1, 0}, {5001, 80, "TCP", "192.168.1.9", "", 0, 0},
                           {5002, 80, "TCP", "192.168.1.7", "", 1, 0}, {5003, 80, "UDP", "192.168.1.9", "", 1, 0},
                           {5004, 80, "GRE", "192.168.1.9", "", 1, 0}, {5005, 80, "TCP", "192.168.1.70", "", 1, 0}};
-        gLog.clear();
-        gSzGateway = "192.168.1.1";
+        StagedTest::SetUp();
         gPHome = &mHome;
         gPNetwork = &mNetwork;
-    }
-    void TearDown() override {
-        gPHome = nullptr;
-        gPNetwork = nullptr;
-        gSzGateway = "192.168.1.1";
     }
     // One request, and what is left of its ports.
     static std::string After(const char* szPorts, int nProtocol, int nExpected = 0) {

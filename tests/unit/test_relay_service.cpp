@@ -115,7 +115,7 @@ void CacheUnknown() {
     Write(SZF_DETECT_MANUAL_CACHE, "[192.168.1.1]\nrouter_detect=\"unknown\"\n");
 }
 
-class RelayService : public testing::Test {
+class RelayService : public StagedTest {
 protected:
     void SetUp() override {
         for (const char* szPath : {"/etc/portforward", "/var/lib/tavo/tasks", "/etc.defaults/portforward", kSystemConf,
@@ -133,23 +133,12 @@ protected:
         mClient = TestClient();
         mClient.nWanted = 60;
         mClient.rgVerdicts = {2, 3, 0};
+        StagedTest::SetUp();
         gPNetwork = &mNetwork;
         gPHome = &mHome;
         gPClient = &mClient;
-        gStage = Stage();
         gStage.blOn = true;
         gFnOnSleep = [] { unlink("/tmp/pfProgress"); };
-        gSzGateway = "192.168.1.1";
-        gLog.clear();
-    }
-    void TearDown() override {
-        gPNetwork = nullptr;
-        gPHome = nullptr;
-        gPClient = nullptr;
-        gStage = Stage();
-        gFnOnSleep = nullptr;
-        gFnOnConfSet = nullptr;
-        gSzGateway = "192.168.1.1";
     }
     Network mNetwork;
     Home mHome;

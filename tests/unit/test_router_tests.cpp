@@ -115,7 +115,7 @@ int TavoPortConnTest(const TAVO_PF_CONF* pRules, int nFlags, TAVO_PORT_STATUS* r
 
 namespace {
 
-class RouterTests : public testing::Test {
+class RouterTests : public StagedTest {
 protected:
     void SetUp() override {
         MakeEmpty({"/etc/portforward", "/usr/tavo/bin", "/var/lib/tavo/tasks"});
@@ -123,15 +123,12 @@ protected:
         for (const char* szFile : {kProgress, "/tmp/pfStatusRule"}) {
             std::filesystem::remove(szFile);
         }
-        gLog.clear();
-        gSzGateway = "192.168.1.1";
+        StagedTest::SetUp();
         gPNetwork = &mNetwork;
         gPClient = &mClient;
     }
     void TearDown() override {
-        gStage = {};
-        gPNetwork = nullptr;
-        gPClient = nullptr;
+        StagedTest::TearDown();
         TLIBCKill(kDaemon, SIGKILL);
     }
     Network mNetwork;

@@ -27,7 +27,7 @@ using Rule = __tag_TAVO_ROUTER_RULE;
 using SaveResult = __tag_TAVO_ROUTER_SAVE_RULE_RESULT;
 using Story = std::vector<std::string>;
 
-class Saving : public testing::Test {
+class Saving : public StagedTest {
 protected:
     void SetUp() override {
         MakeEmpty({"/etc/portforward", "/etc.defaults/portforward", "/usr/tavo"});
@@ -37,8 +37,7 @@ protected:
         Reset();
     }
     void TearDown() override {
-        gFnOnSleep = nullptr;
-        gStage = Stage();
+        StagedTest::TearDown();
         std::filesystem::remove(kMarker);
     }
     // A fresh stage on which whoever applies the rules is done after so many sleeps.
@@ -48,7 +47,7 @@ protected:
             std::filesystem::remove(szFile);
         }
         Write(kRuleConf, kOldRules);
-        gStage = Stage();
+        StagedTest::SetUp();
         gStage.blOn = true;
         gStage.fnRun = [](const std::string&) { gStage.alive.insert("tavoportforward"); };
         gFnOnSleep = [nBusySleeps, nSleep = 0]() mutable {
@@ -57,9 +56,6 @@ protected:
                 gStage.alive.erase("tavoportforward");
             }
         };
-        gSzGateway = "192.168.1.1";
-        gNSlept = 0;
-        gLog.clear();
     }
     static inline const std::string kLong = "longer than a small string:";
     static void Router(const std::string& szNatpmp, const std::string& szUpnp, const std::string& szBrand = "B",

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "network.h"
 #include "stage.h"
 #include "tavo/core.h"
 #include "tavo/log.h"
@@ -15,6 +16,19 @@
 #include "world.h"
 
 Stage gStage;
+
+void StagedTest::SetUp() {
+    gStage = {};
+    gPNetwork = nullptr;
+    gPHome = nullptr;
+    gPClient = nullptr;
+    gFnOnSleep = nullptr;
+    gFnOnConfSet = nullptr;
+    gSzGateway = "192.168.1.1";
+    gNClockAhead = 0;
+    gNSlept = 0;
+    gLog.clear();
+}
 
 void Tell(const std::string& szLine) {
     const OwnMemory own;
