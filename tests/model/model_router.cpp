@@ -28,6 +28,7 @@ template <typename Effect>
 Reply Router::Answer(Effect fnEffect) {
     const Reply lost{tavo::Reply::kTimeout, "timeout"};
     ++nRequests;
+    mNNow += habits.blSlow ? 1 : 0;
     Expire();
     if (Chance(nKillPerMille)) {
         throw Killed();
@@ -72,6 +73,7 @@ std::string Habits::Text() const {
         {blKeepsRemoved, "keeps removed"},
         {blSlowToHide, "slow to hide"},
         {blSlowToShow, "slow to show"},
+        {blSlow, "slow"},
         {blForm, "form"},
         {blApply, "to be applied"},
         {blMute, "mute"},

@@ -41,6 +41,7 @@ struct Habits {
     bool blKeepsRemoved = false;  // says yes to a removal, and keeps the entry
     bool blSlowToHide = false;    // shows an entry for some seconds after it was taken away
     bool blSlowToShow = false;    // shows a new one only some seconds after it was made
+    bool blSlow = false;          // each answer takes a second
     // The router's own pages: no leases, an entry is never changed in place, the box reads the list once and after each
     // change, and begins anew for each pass, with the record from the disk.
     bool blForm = false;
@@ -53,7 +54,7 @@ struct Habits {
 
 class Router : public tavo::Router {
 public:
-    Router(std::mt19937& random, const int64_t& nNow) : mRandom(random), mNNow(nNow) {}
+    Router(std::mt19937& random, int64_t& nNow) : mRandom(random), mNNow(nNow) {}
 
     struct Entry {
         tavo::RouterMapping mapping;
@@ -140,7 +141,7 @@ private:
     std::map<tavo::MappingKey, std::pair<int64_t, Entry>> mMapGone;  // with when it was taken away
     std::optional<std::map<tavo::MappingKey, Entry>> mMapBefore;     // a form's, without what was not applied
     std::mt19937& mRandom;
-    const int64_t& mNNow;
+    int64_t& mNNow;
 };
 
 }  // namespace model

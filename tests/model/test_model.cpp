@@ -11,6 +11,7 @@
 #include <utility>
 
 #include "mapping/Carry.h"
+#include "mapping/Keeper.h"
 #include "model_router.h"
 
 namespace {
@@ -20,7 +21,6 @@ using tavo::RouterMapping;
 
 constexpr int kEvents = 150;                 // of one life
 constexpr int64_t kMostBetween = 3L * 3600;  // seconds from one event to the next
-constexpr int kRetrySeconds = 10;            // as the daemons wait after a pass that failed
 constexpr uint16_t kPorts = 12;
 constexpr size_t kStory = 60;  // events that are told of a life that failed
 constexpr char kStranger[] = "192.168.1.9";
@@ -53,6 +53,7 @@ public:
         habits.blKeepsRemoved = OneIn(12) && !habits.blBlind;
         habits.blSlowToHide = OneIn(6) && !habits.blBlind;
         habits.blSlowToShow = OneIn(6) && !habits.blBlind;
+        habits.blSlow = OneIn(6);
         if (OneIn(5)) {
             habits = {.blPermanentOnly = true, .nText = OneIn(2) ? 0 : 2, .blForm = true, .blMute = OneIn(3)};
             habits.blHidesClient = !habits.blMute && OneIn(3);
@@ -100,6 +101,7 @@ private:
     void Start() {
         mPRecord = std::make_unique<tavo::Record>(mSzDisk, "boot " + std::to_string(mNBoots));
         mHabit = {};
+        mKeeper = {};
         mMapLives.clear();
         mBlDoubtful = true;
         mNNext = mNNow;
@@ -117,7 +119,7 @@ private:
             entry.blBox = false;
         }
     }
-    tavo::RouterName Name() const { return {"192.168.1.1", !mBlHardware ? "" : mBlOther ? "bb" : "aa"}; }
+    tavo::RouterName Name() const { return {mSzAddress, !mBlHardware ? "" : mBlOther ? "bb" : "aa"}; }
 
     // ---- what happens ------------------------------------------------------------------------------
 
@@ -160,7 +162,13 @@ private:
                 Stranger();
                 break;
             case 11:
-                SwapRouters();
+                if (mBlHardware && OneIn(3)) {
+                    mSzAddress = "192.168.1." + std::to_string(1 + Pick(2));
+                    Tell("the router's address " + mSzAddress);
+                    mNNext = mNNow;
+                } else {
+                    SwapRouters();
+                }
                 break;
             case 12:
                 mBlDiskFull = !mBlDiskFull;
@@ -215,7 +223,7 @@ private:
         const model::Router::Entry* pEntry = mRouter.At(key);
         if (pEntry == nullptr) {
             const std::string szClient = OneIn(2) ? kStranger : mRouter.szBox;
-            const bool blBlind = mRouter.habits.blBlind || mRouter.habits.blMute;
+            const bool blBlind = mRouter.habits.blBlind || mRouter.habits.blMute || mRouter.habits.blHidesClient;
             const auto nBoxPort = static_cast<uint16_t>((OneIn(2) && !blBlind ? 100 : 200) + Pick(3));
             model::Router::Entry entry = {{key.first, key.second, nBoxPort, szClient, mRouter.TextOf("game"), 0, true}};
             entry.blOrphan = IsOnRecord(*mPRecord, entry.mapping) || IsOnRecord(DiskRecord(), entry.mapping);
@@ -245,6 +253,7 @@ private:
 
     void RunPass() {
         const auto mapBefore = mRouter.mMapTable;
+        mNPassAt = mNNow;
         const int nRequestsBefore = mRouter.nRequests;
         const int64_t nAllowance =
             mRouter.nLosePerMille + mRouter.nKillPerMille + mRouter.nSkipPerMille + (mRouter.blAway ? 1 : 0) + mNStopIn;
@@ -255,7 +264,7 @@ private:
         mPRecord->TurnTo(Name());
         mPRecord->Prune(mNNow - mNBootAt, mRouter.habits.blBlind);
         const tavo::Record recordBefore = *mPRecord;
-        const std::set<MappingKey> setLost = mHabit.setLost;
+        std::set<MappingKey> setLost = mHabit.setLost;
         mNAdds = 0;
         mHabit.nLease = mRouter.habits.blForm ? 0 : 3600;
         tavo::PassResult result;
@@ -278,12 +287,19 @@ private:
         mNStopIn = 0;
         const bool blWell = result.transport.IsOk() && !result.blStopped;
         mBlDoubtful = mBlDoubtful || !result.transport.IsOk();
-        const int nNext = result.nNextSeconds > 0 ? std::min(mNCheck, result.nNextSeconds) : mNCheck;
-        mNNext = mNNow + (blWell ? nNext : std::min(mNCheck, kRetrySeconds));
+        mNNext = mNNow + SecondsToNext(result);
         mNPeace = nAllowance == 0 && blWell ? mNPeace + 1 : 0;
         CheckStrangers(mapBefore);
-        CheckWords(result, nAllowance != 0);
+        // A slow router's lease may end while the pass goes on.
+        std::set<MappingKey> setEnded;
+        for (const auto& [key, before] : mapBefore) {
+            if (before.nEnd != 0 && before.nEnd <= mNNow) {
+                setEnded.insert(key);
+            }
+        }
+        CheckWords(result, nAllowance != 0, setEnded);
         if (mNPeace >= kPassesToPeace) {
+            setLost.merge(setEnded);
             CheckPeace(result, setLost);
         }
         if (mBlQuiet && nAllowance == 0 && mNAdds == 0 && mRouter.habits.enList == tavo::Reply::kOk) {
@@ -292,6 +308,16 @@ private:
             mBlAllOpen = false;
         }
         mBlQuiet = mBlQuiet || mNPeace >= kPassesToPeace;
+    }
+
+    // As the daemons have it.
+    int SecondsToNext(const tavo::PassResult& result) {
+        std::string szNow;
+        for (const tavo::Outcome& outcome : result.rgOutcomes) {
+            szNow += outcome.szName + outcome.verdict.szWord + (outcome.verdict.blAnew ? " anew" : "");
+        }
+        const bool blChange = std::exchange(mSzLast, std::move(szNow)) != mSzLast;
+        return result.blStopped ? 0 : mKeeper.After(result, blChange, mNCheck).nSeconds;
     }
 
     // What was forgotten is forgotten again by the next process.
@@ -370,7 +396,7 @@ private:
     }
 
     // What is said to be open is open; what may be left of ours is named.
-    void CheckWords(const tavo::PassResult& result, bool blTrouble) {
+    void CheckWords(const tavo::PassResult& result, bool blTrouble, const std::set<MappingKey>& setEnded) {
         for (size_t i = 0; i < mRgWanted.size(); ++i) {
             const MappingKey key = tavo::KeyOf(mRgWanted[i]);
             const model::Router::Entry* pEntry = mRouter.At(key);
@@ -380,7 +406,7 @@ private:
             if (verdict.szWord.empty() || verdict.szWord == "written") {
                 Broken("no verdict", key);
             }
-            if (verdict.enState == tavo::PortState::kOpen && !blThere) {
+            if (verdict.enState == tavo::PortState::kOpen && !blThere && !setEnded.contains(key)) {
                 Broken("said to be open and is not", key);
             }
             if (!blTrouble && verdict.szWord == "lost" && blThere && !mRouter.habits.blSlowToShow) {
@@ -413,7 +439,7 @@ private:
         }
     }
 
-    // setLost: the places that this pass only looked at.
+    // setLost: the places that this pass only looked at, and those whose lease ended meanwhile.
     void CheckPeace(const tavo::PassResult& result, const std::set<MappingKey>& setLost) {
         size_t nUsed = 0;
         for (const auto& [key, entry] : mRouter.mMapTable) {
@@ -441,7 +467,7 @@ private:
             const bool blInTheWay =
                 mRouter.habits.blKeepsRemoved && pEntry != nullptr &&
                 (pEntry->mapping.szClient != mRouter.szBox || pEntry->mapping.nBoxPort != mRgWanted[i].nBoxPort);
-            const bool blNotShownYet = mRouter.habits.blSlowToShow && pEntry != nullptr && pEntry->nMade == mNNow;
+            const bool blNotShownYet = mRouter.habits.blSlowToShow && pEntry != nullptr && pEntry->nMade >= mNPassAt;
             const bool blForgone = mBlDiskFull && result.rgOutcomes[i].verdict.szWord == tavo::kUnrecorded;
             if (blFree && !setLost.contains(key) && !blInTheWay && !blNotShownYet && !blWaits && !blShared &&
                 !blForgone && result.rgOutcomes[i].verdict.enState != tavo::PortState::kOpen) {
@@ -470,6 +496,7 @@ private:
     bool mBlOther = false;
     std::vector<RouterMapping> mRgWanted;
     bool mBlHardware = true;  // the routers can be told apart
+    std::string mSzAddress = "192.168.1.1";  // of the one in front
     bool mBlDiskFull = false;
     bool mBlAllOpen = false;        // at the last pass whose cost was looked at
     int mNStopIn = 0;               // looks at the stop until there is one; 0: there is none
@@ -479,9 +506,12 @@ private:
     std::optional<tavo::Record> mSaved;  // what its text is of
     std::unique_ptr<tavo::Record> mPRecord;
     tavo::Habits mHabit;
+    tavo::Keeper mKeeper;
+    std::string mSzLast;  // what the last pass had to say
     int mNBoots = 0;
     int64_t mNBootAt = 0;
     int64_t mNNext = 0;
+    int64_t mNPassAt = 0;  // when the last one began
     int mNCheck = 120;
     int mNPeace = 0;        // passes since the last trouble
     bool mBlQuiet = false;  // nothing has happened since everything was as it is to be
