@@ -62,10 +62,10 @@ constexpr mode_t kPidFileMode = 0644;
 // As in tmpfiles.d, which makes them at the boot where systemd runs.
 constexpr const char* kLockFiles[] = {kRouterLock, "/tmp/upnp_detector.lock", "/tmp/natpmp_detector.lock",
                                       "/tmp/upnp_test.lock"};
-constexpr int kCutPasses = 3;  // in a row, before one goes on to its end
+constexpr int kCutPasses = 3;                              // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(60);  // of a router that answers slowly
 constexpr auto kEndLimit = std::chrono::seconds(70);       // for another instance: a pass, and the mappings
-constexpr auto kSettle = std::chrono::seconds(1);      // an address rarely changes alone
+constexpr auto kSettle = std::chrono::seconds(1);          // an address rarely changes alone
 // Between passes: that anybody on the network can cause, and that this box's own addresses, routes and links do.
 constexpr auto kRouterPause = std::chrono::seconds(5);
 constexpr auto kNetworkPause = std::chrono::seconds(2);

@@ -104,7 +104,7 @@ private:
     std::string mSzBox;
     std::string mSzHardware;  // of the gateway, as it was last seen
     Keeper mKeeper;
-    std::string mSzLast;  // what the last pass had to say
+    std::string mSzLast;           // what the last pass had to say
     BootClock::time_point mHeard;  // when the router last answered
     std::string mSzOutside;
     int mNUntilOutside = 0;  // passes until the router is asked for it again

@@ -41,7 +41,7 @@ private:
     EpochWatch* mPEpoch = nullptr;                 // of the one in front; null before the first pass there
     bool mBlDoubtful = false;  // the gateway did not answer the last time, or had just started: it may have begun anew
     BootClock::time_point mNextDoubt;  // when a word of the router's may make it so again
-    std::string mSzOutside;    // its address on its other side, as it said the last time
+    std::string mSzOutside;            // its address on its other side, as it said the last time
 };
 
 }  // namespace tavo

@@ -43,7 +43,7 @@ private:
     std::string mSzKnownHardware;  // of the router whose habits are known
     std::unique_ptr<Igd> mPIgd;
     std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
-    Descriptor mFdLate;  // where nothing was found, what comes later is heard
+    Descriptor mFdLate;             // where nothing was found, what comes later is heard
     Habits mHabit;
     MadeFile mMade;
     Events mEvents;

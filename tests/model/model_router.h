@@ -33,7 +33,7 @@ struct Habits {
     bool blSaysFull = true;                 // else it says yes and keeps nothing
     tavo::Reply enList = tavo::Reply::kOk;  // what a listing answers; kTooLong with the first entries
     bool blRanges = false;
-    bool blRangesLie = false;  // a range leaves out the asker's own
+    bool blRangesLie = false;    // a range leaves out the asker's own
     bool blSaysChanged = false;  // says yes to a change of its own entry, and keeps it as it was
     // Shows nothing, lends everything, gives another port where the wanted one is taken, and knows a mapping by its
     // client and the client's port.

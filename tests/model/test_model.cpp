@@ -495,7 +495,7 @@ private:
     bool mBlDoubtful = true;               // what a blind one granted may be gone
     bool mBlOther = false;
     std::vector<RouterMapping> mRgWanted;
-    bool mBlHardware = true;  // the routers can be told apart
+    bool mBlHardware = true;                 // the routers can be told apart
     std::string mSzAddress = "192.168.1.1";  // of the one in front
     bool mBlDiskFull = false;
     bool mBlAllOpen = false;        // at the last pass whose cost was looked at

@@ -44,7 +44,7 @@ TEST(Ssdp, AnAnswerLeadsToTheGatewayOrNowhere) {
     const auto fnAt = [](const std::string& szPlace) { return "HTTP/1.1 200 OK\r\nLOCATION: " + szPlace + "\r\n\r\n"; };
     struct Case {
         std::string szAnswer;
-        const char* szPlace;        // of the gateway's answer; empty: it leads nowhere
+        const char* szPlace;      // of the gateway's answer; empty: it leads nowhere
         bool blAnybodys = false;  // it would count from another address, too
     };
     const Case rgCases[] = {
@@ -85,10 +85,10 @@ TEST(Igd, DescriptionsLeadToTheGateway) {
     const tavo::HttpUrl location{"192.168.1.1", 80, "/dir/root.xml"};
     const auto fnControl = [&](const std::string& szControl, const std::string& szExtra) {
         const auto service = ServiceIn("<root>" + szExtra +
-                                                        "<d><d><service><serviceType>urn:schemas-upnp-org:service:"
-                                                        "WANPPPConnection:1</serviceType><controlURL>" +
-                                                        szControl + "</controlURL></service></d></d></root>",
-                                                    location);
+                                           "<d><d><service><serviceType>urn:schemas-upnp-org:service:"
+                                           "WANPPPConnection:1</serviceType><controlURL>" +
+                                           szControl + "</controlURL></service></d></d></root>",
+                                       location);
         return service ? service->control.Text() : "";
     };
     EXPECT_EQ(fnControl("/ctl?a=b", ""), "http://192.168.1.1:80/ctl?a=b");
@@ -117,10 +117,10 @@ TEST(Igd, DescriptionsLeadToTheGateway) {
             szClose += "</a>";
         }
         EXPECT_EQ(ServiceIn("<root>" + szOpen +
-                                             "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
-                                             "</serviceType><controlURL>/c</controlURL></service>" +
-                                             szClose + "</root>",
-                                         location)
+                                "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:1"
+                                "</serviceType><controlURL>/c</controlURL></service>" +
+                                szClose + "</root>",
+                            location)
                       .has_value(),
                   nDepth == 10)
             << nDepth;
@@ -142,8 +142,12 @@ TEST(Igd, BrokenDescriptionsAreReadAsFarAsTheyGo) {
         return "<root xmlns='urn:x'><device><modelName>" + szModel + "</modelName>" + szMore + "<serviceList>" +
                szService + "</serviceList></device></root>";
     };
-    const std::string szLatin1 = "Stra\xDF" "e";
-    const std::string szUtf8 = "Stra\xC3\x9F" "e";
+    const std::string szLatin1 =
+        "Stra\xDF"
+        "e";
+    const std::string szUtf8 =
+        "Stra\xC3\x9F"
+        "e";
     std::string szAttributes;
     for (int i = 0; i < 20000; ++i) {
         szAttributes += " a" + std::to_string(i) + "=''";
@@ -657,11 +661,14 @@ TEST_F(SearchTest, IsOverSoonWhereThereIsNobody) {
 
 // Some answer to the protocol's own port only, and some when nobody waits any more.
 TEST_F(SearchTest, WhatComesFromOddPlacesAndLateIsHeard) {
-    EXPECT_TRUE(Search(5000, [this] {
-        if (Hear() && ntohs(mFrom.sin_port) == 1900) {
-            Say(Answer("/a"));
-        }
-    }, 0, true));
+    EXPECT_TRUE(Search(
+        5000,
+        [this] {
+            if (Hear() && ntohs(mFrom.sin_port) == 1900) {
+                Say(Answer("/a"));
+            }
+        },
+        0, true));
     EXPECT_EQ(std::set(mRgszTargets.begin(), mRgszTargets.end()).size(), 9U);
     tavo::Descriptor fdLate;
     const auto fnNever = [](const tavo::HttpUrl&) { return false; };

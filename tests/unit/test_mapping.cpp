@@ -1001,7 +1001,8 @@ TEST(Mapping, AShortLeaseIsRenewedEveryFiveSecondsAndSaidToBeShort) {
 
 // One that ends a lease late is asked again soon, and one that does not end it is not asked every few seconds for ever.
 TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
-    for (const auto& [nAge, nNext, nLeft] : {std::tuple(7200, 0, 0U), {3661, 0, 0U}, {3660, 5, 0U}, {3600, 5, 1U}, {3590, 11, 10U}}) {
+    for (const auto& [nAge, nNext, nLeft] :
+         {std::tuple(7200, 0, 0U), {3661, 0, 0U}, {3660, 5, 0U}, {3600, 5, 1U}, {3590, 11, 10U}}) {
         MemoryRouter router;
         Core core;
         core.nNow = 10000;

@@ -299,8 +299,8 @@ const std::vector<Store>& Stores() {
          TakeOverJobs, KeptJobs, "earlier", "12"},
         Plain("a test's mappings", KeepTest, KeptTest, "old", "new"),
         Plain(
-            "a known router", KeepKnown, [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old", "new", "",
-            true),
+            "a known router", KeepKnown, [] { return tavo::RecallRouter("192.168.1.1").place.szLocation; }, "old",
+            "new", "", true),
         Plain("a task", StoreTask, StoredTask, "old", "new"),
         Plain("the first task", StoreTask, StoredTask, kNone, "new"),
         Plain("a draft", WriteDraft, ReadDraft, "old", "new"),

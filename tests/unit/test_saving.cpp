@@ -299,7 +299,7 @@ TEST_F(Saving, SurvivesMemoryThatRunsOutAnywhere) {
          {"fail to get brand", "fail to get model", "fail to get version", "get max rule fail", "add rule failed",
           "can not get max ports", "sync rule to file fail", "failed to allocate list", "get router conf failed",
 #ifndef __SANITIZE_ADDRESS__  // where only C++ memory runs out
-                               "malloc fail: szRemap"
+          "malloc fail: szRemap"
 #endif
          }) {
         EXPECT_TRUE(said.contains(szLine)) << szLine;

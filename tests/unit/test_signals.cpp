@@ -242,8 +242,8 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
     signal(SIGHUP, SIG_DFL);
 }
 
-// A word of the router, or a change of the box's own network, brings the next pass near, but not nearer than some seconds
-// after the last such pass.
+// A word of the router, or a change of the box's own network, brings the next pass near, but not nearer than some
+// seconds after the last such pass.
 TEST(Daemon, NewsIsHeardSoonAndNotTooOften) {
     for (const bool blNetwork : {false, true}) {
         std::filesystem::remove(kNames.szResultFile);

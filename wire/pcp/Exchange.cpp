@@ -45,7 +45,8 @@ void WaitUntil(int fd, Clock::time_point when) {
 }  // namespace
 
 ExchangeEnd Exchange(const in_addr& source, const in_addr& gateway, std::span<const uint8_t> rgQuestion,
-                     milliseconds limit, const std::function<bool(std::span<const uint8_t>)>& fnTake, const std::function<bool()>& fnStop) {
+                     milliseconds limit, const std::function<bool(std::span<const uint8_t>)>& fnTake,
+                     const std::function<bool()>& fnStop) {
     const Descriptor fd = Connect(source, gateway);
     const Clock::time_point end = Clock::now() + limit;
     Clock::time_point nextSending = Clock::now();

@@ -21,7 +21,8 @@ enum class ExchangeEnd {
 
 // Sends, and sends again after a quarter of a second, then after twice as long each time: UDP gets lost.
 // fnTake is shown each datagram until it answers true. source: the address of the box's that asks; 0.0.0.0: any.
-ExchangeEnd Exchange(const in_addr& source, const in_addr& gateway, std::span<const uint8_t> rgQuestion, std::chrono::milliseconds limit,
-                     const std::function<bool(std::span<const uint8_t>)>& fnTake, const std::function<bool()>& fnStop);
+ExchangeEnd Exchange(const in_addr& source, const in_addr& gateway, std::span<const uint8_t> rgQuestion,
+                     std::chrono::milliseconds limit, const std::function<bool(std::span<const uint8_t>)>& fnTake,
+                     const std::function<bool()>& fnStop);
 
 }  // namespace tavo

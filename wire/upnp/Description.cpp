@@ -50,7 +50,8 @@ std::string ModelText(const XmlElement& device, std::string_view szName) {
 }
 
 bool MapsPorts(const std::string& szType) {
-    return std::any_of(std::begin(kTypes), std::end(kTypes), [&](const char* szKind) { return szType.starts_with(szKind); });
+    return std::any_of(std::begin(kTypes), std::end(kTypes),
+                       [&](const char* szKind) { return szType.starts_with(szKind); });
 }
 
 // The services below an element that map ports.
@@ -119,10 +120,10 @@ std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl
             rgServices.push_back({element.Child("serviceType").Text(), *control, fnResolve("eventSubURL"), model});
         }
     }
-    szWhy = !rgServices.empty()   ? ""
-            : !root               ? "it cannot be read"
+    szWhy = !rgServices.empty()  ? ""
+            : !root              ? "it cannot be read"
             : rgElements.empty() ? "it has no service that maps ports"
-                                  : "its service has no address";
+                                 : "its service has no address";
     return rgServices;
 }
 

@@ -28,7 +28,9 @@ std::string StateOf(const std::string& szGateway, const char* szKey) {
 
 KnownRouter RecallRouter(const std::string& szGateway) {
     const auto fnValue = [&](const char* szKey) { return StateOf(szGateway, szKey); };
-    return {{fnValue("location"), fnValue("service")}, fnValue("hardware"), fnValue("permanent") == "yes",
+    return {{fnValue("location"), fnValue("service")},
+            fnValue("hardware"),
+            fnValue("permanent") == "yes",
             fnValue("ranges") == "no"};
 }
 

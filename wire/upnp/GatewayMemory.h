@@ -11,7 +11,7 @@
 namespace tavo {
 
 struct KnownRouter {
-    IgdPlace place;  // where its service was last found
+    IgdPlace place;               // where its service was last found
     std::string szHardware = {};  // of the router that this is true of; empty: not known
     bool blPermanentOnly = false;
     bool blNoRanges = false;

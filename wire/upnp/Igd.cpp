@@ -77,7 +77,7 @@ std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransp
                              const std::string& szKnown) {
     const HttpAnswer answer = pHttp->Get(location);
     if (answer.enEnd != HttpEnd::kAnswered || answer.nCode != 200) {
-        szWhy = answer.enEnd == HttpEnd::kAnswered   ? "HTTP status " + std::to_string(answer.nCode)
+        szWhy = answer.enEnd == HttpEnd::kAnswered  ? "HTTP status " + std::to_string(answer.nCode)
                 : answer.enEnd == HttpEnd::kTimeout ? "no answer in time"
                                                     : "no answer that makes sense";
         return nullptr;

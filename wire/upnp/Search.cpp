@@ -50,7 +50,7 @@ struct Asking {
     Targets rgTargets;
     bool blKnownPort = false;  // from the port of the protocol: some answer to that one only
 };
-constexpr Asking kAskings[] = {{0, kLikely},    {150, kLikely},  {300, kRest}, {600, kLikely},
+constexpr Asking kAskings[] = {{0, kLikely},  {150, kLikely},        {300, kRest},   {600, kLikely},
                                {1000, kRest}, {1300, kLikely, true}, {1500, kLikely}};
 
 sockaddr_in Address(const char* szHost, uint16_t nPort) {

@@ -44,8 +44,7 @@ int CodeOf(const HttpAnswer& answer, const XmlElement& root) {
 
 }  // namespace
 
-SoapAnswer::SoapAnswer(const HttpAnswer& answer)
-    : mDocument(answer.szBody), mNCode(CodeOf(answer, mDocument.Root())) {}
+SoapAnswer::SoapAnswer(const HttpAnswer& answer) : mDocument(answer.szBody), mNCode(CodeOf(answer, mDocument.Root())) {}
 
 SoapAnswer CallService(HttpTransport& http, const HttpUrl& control, const std::string& szService, const char* szAction,
                        const std::vector<SoapArgument>& rgArguments) {

@@ -49,7 +49,8 @@ _xmlDoc* Parse(const std::string& szText) {
     };
     const std::string_view szHead = std::string_view(szText).substr(0, szText.find("?>"));
     const bool blSays = szHead.starts_with("<?xml") && szHead.find("encoding") != std::string_view::npos &&
-                        szHead.find("utf-8") == std::string_view::npos && szHead.find("UTF-8") == std::string_view::npos;
+                        szHead.find("utf-8") == std::string_view::npos &&
+                        szHead.find("UTF-8") == std::string_view::npos;
     if (blSays || xmlCheckUTF8(reinterpret_cast<const xmlChar*>(szText.c_str())) == 1) {
         _xmlDoc* pDocument = fnRead(nullptr, 0);
         if (!blSays || (pDocument != nullptr && xmlDocGetRootElement(pDocument) != nullptr)) {
