@@ -537,17 +537,25 @@ void Forget(Record& record, Habits& habit, const std::string& szBox, bool blRest
     }
 }
 
-// Routers of the first generation know permanent mappings only; some say so, some call it bad arguments.
+// Routers of the first generation know permanent mappings only; some say so, some call it bad arguments, and some only
+// refuse: those are asked once without a lease.
 RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) {
     const RouterMapping wanted = mapping;
     mapping.nLease = habit.blPermanentOnly ? 0 : habit.nLease;
+    const bool blLease = mapping.nLease != 0;
     RouterReply reply = router.Add(mapping);
-    if (mapping.nLease != 0 && (reply.enReply == Reply::kOnlyPermanent || reply.enReply == Reply::kBadArguments)) {
-        const bool blSaysSo = reply.enReply == Reply::kOnlyPermanent;
+    const bool blSaysSo = reply.enReply == Reply::kOnlyPermanent;
+    const bool blMayBeLease =
+        reply.enReply == Reply::kBadArguments || (reply.enReply == Reply::kRefused && !habit.blLeaseNoMatter);
+    if (blLease && (blSaysSo || blMayBeLease)) {
         mapping = wanted;
         mapping.nLease = 0;
-        reply = router.Add(mapping);
-        habit.blPermanentOnly = habit.blPermanentOnly || (reply.IsOk() || blSaysSo);
+        RouterReply without = router.Add(mapping);
+        habit.blPermanentOnly = habit.blPermanentOnly || without.IsOk() || blSaysSo;
+        habit.blLeaseNoMatter = habit.blLeaseNoMatter || without.enReply == Reply::kRefused;
+        reply = std::move(without);
+    } else if (blLease && reply.IsOk()) {
+        habit.blLeaseNoMatter = true;
     }
     return reply;
 }
@@ -558,6 +566,7 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
         // What it can do is true for as long as nothing says that it is another one.
         const bool blOther = !habit.router.szGateway.empty() && !habit.router.IsSame(record.Router());
         habit.blPermanentOnly = habit.blPermanentOnly && !blOther;
+        habit.blLeaseNoMatter = habit.blLeaseNoMatter && !blOther;
         habit.blNoRanges = habit.blNoRanges && !blOther;
         habit.mapElsewhere.clear();
         habit.setLost.clear();

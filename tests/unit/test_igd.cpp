@@ -297,7 +297,7 @@ TEST(Igd, ARangeShowsWhatMakesSense) {
                "</p:NewInternalClient></p:E>";
     };
     const std::string szGood = fnEntry("1", "192.168.1.5");
-    const std::string szBad = fnEntry("65536", "192.168.1.5") + fnEntry("-1", "192.168.1.5") + fnEntry("2", "evil");
+    const std::string szBad = fnEntry("65536", "192.168.1.5") + fnEntry("-1", "192.168.1.5");
     const auto fnListing = [](const std::string& szInner) {
         return "<NewPortListing><![CDATA[<p:List xmlns:p='x'>" + szInner + "</p:List>]]></NewPortListing>";
     };
@@ -419,7 +419,7 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
     const std::tuple<std::vector<std::pair<int, std::string>>, int, size_t> rgCases[] = {
         {{{1, szOne}, {2, szOne}}, tavo::kWireOk, 2},
         {{{1, szOne}, {1, szTwo}, {2, szOne}}, tavo::kWireOk, 2},
-        {{{1, szOne}, {0x10000, szOne}, {3, "evil"}, {2, szOne}}, tavo::kWireOk, 2},  // what makes no sense, too
+        {{{1, szOne}, {0x10000, szOne}, {3, "evil"}, {2, szOne}}, tavo::kWireOk, 3},  // what makes no sense, too
         {{{1, szOne}, {1, szOne}, {2, szOne}}, tavo::kWireTooLong, 1}};
     for (const auto& [rgEntries, nCode, nShown] : rgCases) {
         const auto pHttp = std::make_shared<Table>();
@@ -472,8 +472,11 @@ TEST(Igd, WhatAnEntryAndAnAddressSay) {
         {"1", "192.168.1.5", "4294967296", "no", "1 0 off"},
         {"65536", "192.168.1.5", "0", "1", "none"},
         {"", "192.168.1.5", "0", "1", "none"},
-        {"1", "192.168.1", "0", "1", "none"},
-        {"1", "", "0", "1", "none"}};
+        {"1", "192.168.1", "0", "FALSE", "1 0 off ?"},
+        {"1", "", "0", "1", "1 0 on ?"},
+        {"1", "box.lan", "0", "1", "1 0 on ?"},
+        {"1", " 192.168.001.005 ", "0", "1", "1 0 on"},
+        {"1", "0192.168.1.05", "0", "1", "1 0 on"}};
     for (const auto& [szPort, szClient, szLease, szEnabled, szRead] : rgCases) {
         pHttp->mSzAnswer = fnTag("NewInternalPort", szPort) + fnTag("NewInternalClient", szClient) +
                            fnTag("NewLeaseDuration", szLease) + fnTag("NewEnabled", szEnabled);
@@ -483,7 +486,8 @@ TEST(Igd, WhatAnEntryAndAnAddressSay) {
         EXPECT_EQ(nCode, szRead == "none" ? tavo::kWireGarbage : tavo::kWireOk);
         EXPECT_EQ(nCode != 0 ? "none"
                              : std::to_string(entry.nBoxPort) + " " + std::to_string(entry.nLease) +
-                                   (entry.blEnabled ? " on" : " off"),
+                                   (entry.blEnabled ? " on" : " off") +
+                                   (entry.szClient == "192.168.1.5" ? "" : entry.szClient + " ?"),
                   szRead);
         EXPECT_EQ(entry.szProtocol, nCode == 0 ? "UDP" : "as");
         EXPECT_NE(pHttp->mSzAsked.find("<NewExternalPort>65535</NewExternalPort><NewProtocol>UDP</NewProtocol>"),

@@ -1420,6 +1420,26 @@ TEST(Record, OfEveryPortIsReadBack) {
     std::remove(kFile);
 }
 
+// Some do not say what they refuse. One question more tells, once a router.
+TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
+    class Mute : public MemoryRouter {
+    public:
+        RouterReply Add(RouterMapping& mapping) override {
+            ++nAdds;
+            return blAll || mapping.nLease != 0 ? IgdReply(501) : MemoryRouter::Add(mapping);
+        }
+        bool blAll = false;
+        int nAdds = 0;
+    };
+    for (const bool blAll : {false, true}) {
+        Mute router;
+        router.blAll = blAll;
+        EXPECT_EQ(Texts(Core().Run(router, Wanted(2))), blAll ? (Rows{"1/tcp 501", "2/tcp 501"})
+                                                              : (Rows{"1/tcp 1 anew", "2/tcp 1 anew"}));
+        EXPECT_EQ(router.nAdds, 3);
+    }
+}
+
 TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
     class Old : public MemoryRouter {
     public:

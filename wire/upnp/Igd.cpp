@@ -9,6 +9,7 @@
 #include <map>
 
 #include "ground/SysLog.h"
+#include "ground/TextFile.h"
 #include "ground/net/Level.h"
 #include "wire/upnp/Search.h"
 #include "wire/upnp/Soap.h"
@@ -28,25 +29,39 @@ bool IsAddress(const std::string& szText) {
     return inet_pton(AF_INET, szText.c_str(), &address) == 1;
 }
 
+// The address of a host as a router writes it, some with zeros before each number; empty where it is none, as a name.
+std::string AddressIn(const std::string& szText) {
+    std::string szAddress;
+    for (const char c : szText) {
+        const bool blZero = szAddress.ends_with("0") && (szAddress.size() == 1 || szAddress.ends_with(".0"));
+        if (blZero && c != '.') {
+            szAddress.pop_back();
+        }
+        szAddress += c;
+    }
+    return IsAddress(szAddress) ? szAddress : "";
+}
+
 // What an entry's answer says beyond its key.
 bool ReadEntry(const XmlElement& root, IgdEntry& mapping) {
     const auto nBoxPort = ParseNumber<uint16_t>(root.Find("NewInternalPort").Text());
-    mapping.szClient = root.Find("NewInternalClient").Text();
-    if (!nBoxPort || !IsAddress(mapping.szClient)) {
+    if (!nBoxPort) {
         return false;
     }
+    mapping.szClient = AddressIn(root.Find("NewInternalClient").Text());
     mapping.nBoxPort = *nBoxPort;
     mapping.szDescription = root.Find("NewPortMappingDescription").Text();
     mapping.nLease = ParseNumber<uint32_t>(root.Find("NewLeaseDuration").Text()).value_or(0);
     const std::string szEnabled = root.Find("NewEnabled").Text();
-    mapping.blEnabled = szEnabled != "0" && szEnabled != "false" && szEnabled != "no";
+    mapping.blEnabled = szEnabled != "0" && !IsSameWord(szEnabled, "false") && !IsSameWord(szEnabled, "no");
     return true;
 }
 
 bool ReadKey(const XmlElement& root, IgdEntry& mapping) {
     const auto nRouterPort = ParseNumber<uint16_t>(root.Find("NewExternalPort").Text());
-    mapping.szProtocol = root.Find("NewProtocol").Text();
-    if (!nRouterPort || (mapping.szProtocol != "TCP" && mapping.szProtocol != "UDP")) {
+    const std::string szProtocol = root.Find("NewProtocol").Text();
+    mapping.szProtocol = IsSameWord(szProtocol, "TCP") ? "TCP" : IsSameWord(szProtocol, "UDP") ? "UDP" : "";
+    if (!nRouterPort || mapping.szProtocol.empty()) {
         return false;
     }
     mapping.nRouterPort = *nRouterPort;

@@ -23,7 +23,7 @@ struct IgdEntry {
     std::string szProtocol;  // "TCP" or "UDP"
     uint16_t nRouterPort = 0;
     uint16_t nBoxPort = 0;
-    std::string szClient;       // dotted address of the host behind the port
+    std::string szClient;       // dotted address of the host behind the port; empty: the router does not say
     std::string szDescription;  // printable, bounded
     uint32_t nLease = 0;        // seconds; 0: until the router restarts
     bool blEnabled = false;
