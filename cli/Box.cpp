@@ -7,7 +7,9 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
+#include <utility>
 
 namespace tavo::cli {
 
@@ -108,14 +110,16 @@ std::optional<std::string> OtherLimit(const std::string& szBrand, const std::str
 }
 
 std::optional<std::string> RecordMaxRules(const __tag_TAVO_ROUTER_CONF& conf, int nMaxRules) {
-    const std::string szBrand = conf.szBrand;
-    // The database has one record for all models of these two makers.
-    const bool blWholeBrand = szBrand == "Tavo Inc." || szBrand == "AirPort";
-    RouterUpnpDBUserWriter writer(blWholeBrand ? szBrand + "//" : szBrand + "/" + conf.szModel + "/" + conf.szVersion);
-    if (!writer.Init() || !writer.SetSupport("yes") || !writer.SetMaxRule(nMaxRules) || !writer.Sync()) {
+    __tag_TAVO_ROUTER_RECORD record = {"", "", "", "yes", nMaxRules};
+    for (const auto& [szField, szValue] : {std::pair{record.szBrand, conf.szBrand},
+                                           {record.szModel, conf.szModel},
+                                           {record.szVersion, conf.szVersion}}) {
+        std::snprintf(szField, TAVO_TEXT_SIZE, "%s", szValue);
+    }
+    if (TLibWriteRecordIntoUpnpDB(&record) != 0) {
         return "the number of rules could not be recorded in /etc/portforward/router_upnp.db.user";
     }
-    return OtherLimit(szBrand, conf.szModel, conf.szVersion, nMaxRules);
+    return OtherLimit(conf.szBrand, conf.szModel, conf.szVersion, nMaxRules);
 }
 
 }  // namespace tavo::cli

@@ -55,7 +55,7 @@ bool Download(const char* szName) {
 }  // namespace
 
 RouterUpnpDB::RouterUpnpDB(const std::string& brand, const std::string& model, const std::string& version)
-    : mSzKey(brand == "Tavo Inc." || brand == "AirPort" ? brand + "//" : brand + "/" + model + "/" + version) {}
+    : mSzKey(tavo::lib::RouterKey(brand, model, version)) {}
 
 RouterUpnpDB::~RouterUpnpDB() = default;
 

@@ -166,7 +166,7 @@ int TLibWriteRecordIntoUpnpDB(const __tag_TAVO_ROUTER_RECORD* record) {
             LogError("%s:%d record is NULL", kEntryFile, __LINE__);
             return -1;
         }
-        RouterUpnpDBUserWriter writer(std::string(record->szBrand) + "/" + record->szModel + "/" + record->szVersion);
+        RouterUpnpDBUserWriter writer(tavo::lib::RouterKey(record->szBrand, record->szModel, record->szVersion));
         if (!writer.SetSupport(record->szSupport)) {
             LogError("%s:%d set support failed", kEntryFile, __LINE__);
             return -1;

@@ -24,6 +24,12 @@ inline std::string InQuotes(std::string_view szText) {
     return szOut;
 }
 
+// What a model's record is called in the compatibility databases. Two makers have one for all their models.
+inline std::string RouterKey(const std::string& szBrand, const std::string& szModel, const std::string& szVersion) {
+    const bool blWholeBrand = szBrand == "Tavo Inc." || szBrand == "AirPort";
+    return blWholeBrand ? szBrand + "//" : szBrand + "/" + szModel + "/" + szVersion;
+}
+
 // Decimal number of a text as strtol reads it; values outside int are clamped.
 inline int ToInt(const char* szText) {
     return static_cast<int>(std::clamp(std::strtol(szText, nullptr, 10), long{INT_MIN}, long{INT_MAX}));

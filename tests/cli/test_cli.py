@@ -836,7 +836,10 @@ class Tool(unittest.TestCase):
         self.expect("router set --max-rules 20", OK, "stored as the settings")
         self.expect("detect --last --max-rules 20", USAGE, "with --save")
         self.expect("router show", OK, "model +R9\n(?s:.)*holds +20 rules\n")
-        self.expect("router set --model R1 --version 1 --max-rules 20", FAILED, "says that this router holds 1 rules")
+        self.expect("router set --brand AirPort --max-rules 21", OK, "stored as the settings")
+        self.assertEqual(self.json("router", "show")[1]["router"]["max_rules"], 21)
+        self.expect("router set --brand Acme --model R1 --version 1 --max-rules 20", FAILED,
+                    "says that this router holds 1 rules")
         self.assertEqual(self.json("router", "show")[1]["router"]["max_rules"], 1)
         self.expect("status", OK, r"settings +Acme R1 \(1\), driven by UPnP")
         self.expect("detect --save", OK, "stored as the settings", LD_PRELOAD=STAND_IN,

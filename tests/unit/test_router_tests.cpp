@@ -422,6 +422,16 @@ TEST_F(RouterTests, RecordIsTheOnlyOne) {
     EXPECT_TRUE(RouterUpnpDB("a\"]\n[b", "", "").GetMaxRule(nMax));
     EXPECT_EQ(nMax, 32);
     EXPECT_EQ(Read("/etc/portforward/router_upnp.db.user").find("[//]"), std::string::npos) << "the last one went";
+    // Two makers have one record for all their models, wherever it is looked for.
+    for (const auto& [szMaker, szKey] :
+         {std::pair{"AirPort", "AirPort//"}, {"Tavo Inc.", "Tavo Inc.//"}, {"airport", "airport/m/1"}}) {
+        record = {"", "m", "1", "yes", 9};
+        snprintf(record.szBrand, sizeof(record.szBrand), "%s", szMaker);
+        EXPECT_EQ(TLibWriteRecordIntoUpnpDB(&record), 0);
+        EXPECT_TRUE(Read("/etc/portforward/router_upnp.db.user").starts_with("[" + std::string(szKey) + "]\n"))
+            << szKey;
+        EXPECT_TRUE(RouterUpnpDB(szMaker, "m", "1").GetMaxRule(nMax)) << szKey;
+    }
 }
 
 void SetDetected(const char* szBrand) {
