@@ -1,5 +1,4 @@
-// Lines of the platform for the system log. Relies on syslog. Promises: a line stays one line and can do nothing to a
-// terminal, whatever the values in it hold (a control character stands as \xHH); needs no memory; errno is kept.
+// Lines of the platform for the system log. Relies on syslog. Promises: see LogLine.h.
 #pragma once
 
 #include <syslog.h>

@@ -1,11 +1,8 @@
-// The system log at priority error. Relies on syslog. Promises: a line that cannot be made is left out.
+// The system log at priority error. Relies on the one maker of log lines, a header that needs no platform.
+// Promises: see Log.h.
 #include "Log.h"
 
-#include <syslog.h>
-
-#include <cerrno>
-#include <cstdio>
-#include <cstdlib>
+#include "ground/LogLine.h"
 
 namespace tavo::lib {
 
@@ -25,14 +22,7 @@ bool Refuse(const char* szFormat, ...) {
 }
 
 void LogErrorV(const char* szFormat, va_list arguments) {
-    const int nErrno = errno;
-    char* szLine = nullptr;
-    const int nLength = vasprintf(&szLine, szFormat, arguments);
-    if (nLength >= 0) {
-        syslog(LOG_ERR, "%s", szLine);
-        std::free(szLine);
-    }
-    errno = nErrno;
+    WriteLogLine(LOG_ERR, szFormat, arguments);
 }
 
 }  // namespace tavo::lib

@@ -1,4 +1,5 @@
-// The system log, as every file of the library writes to it. Relies on nothing. Promises: errno is kept.
+// The system log, as every file of the library writes to it. Relies on nothing. Promises: errno is kept; a
+// line needs no memory, but to be whole beyond 4,095 bytes; a control character in a value stands as \xHH.
 #pragma once
 
 #include <cstdarg>

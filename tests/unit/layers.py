@@ -14,6 +14,7 @@ MAPPING = ["mapping/", *GROUND]
 # The longest prefix counts.
 MAY_KNOW = {
     "src/": ["src/", "include/", SEAM],
+    "src/Log.cpp": ["src/Log.h", "ground/LogLine.h"],
     "src/merge/": ["src/merge/", "include/libtavoportmap.h"],
     "platform/linux/": ["platform/linux/", *WIRE],
     "ground/": GROUND,

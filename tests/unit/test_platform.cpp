@@ -15,6 +15,7 @@
 #include <thread>
 #include <utility>
 
+#include "Log.h"
 #include "ground/Directory.h"
 #include "ground/FileLock.h"
 #include "ground/LogFile.h"
@@ -327,12 +328,23 @@ TEST(SystemLog, ALineStaysOneLineOfPlainText) {
         gLog.clear();
         errno = ENOTTY;
         tavo::SysLog(LOG_ERR, "say %s", rgszCase[0]);
-        EXPECT_EQ(gLog, std::vector<std::string>{rgszCase[1]});
+        tavo::lib::LogError("say %s\n", rgszCase[0]);  // the library has a line that ends so
+        EXPECT_EQ(gLog, (std::vector<std::string>{rgszCase[1], rgszCase[1] + std::string("\n")}));
         EXPECT_EQ(errno, ENOTTY);
     }
     gLog.clear();
     tavo::SysLog(LOG_ERR, "say %s", std::string(100000, '\n').c_str());
     EXPECT_EQ(gLog.front().substr(0, 8), "\\x0a\\x0a");
+    // One that is longer than what is set aside for it is whole as long as there is memory.
+    const std::string szLong(6000, 'x');
+    for (const long nGood : {-1L, 0L}) {
+        gLog.clear();
+        gNGoodAllocations = nGood;
+        tavo::lib::LogError("say %s", szLong.c_str());
+        gNGoodAllocations = -1;
+        ASSERT_EQ(gLog.size(), 1U);
+        EXPECT_TRUE(nGood < 0 ? gLog.front() == szLong : gLog.front().size() > 2000);
+    }
     // A value on its way through the platform.
     gLog.clear();
     Write("/tmp/t/a\nb", "no section\n");
