@@ -227,6 +227,7 @@ int ParsePorts(const MergeHost& host, PortList& ports, const char* szPort) {
     try {
         return ReadPorts(host, ports, szPort);
     } catch (const std::bad_alloc&) {
+        host.LogError("%s:%d memory has run out in %s()", kHopLinkFile, __LINE__, __func__);
         return -1;
     }
 }

@@ -581,17 +581,21 @@ TEST_F(Detection, MemoryThatRunsOutLosesNoSettings) {
         RouterConf conf = MakeConf(blManual ? "no" : "yes", "no");
         RunOutOfMemory([&](const auto& fnArm) {
             Write(kRouterConf, szOld);
+            gLog.clear();
             fnArm();
             const int nStored = TLibSetRouterConf("192.168.1.1", &conf, nullptr, true);
             gNGoodAllocations = -1;
+            EXPECT_TRUE(nStored == 0 || !gLog.empty());
             const std::string szNow = Read(kRouterConf);
             EXPECT_TRUE(szNow == szOld || nStored == 0 || (!blManual && szNow.empty())) << szNow;
             EXPECT_EQ(szNow.find("Acme") != std::string::npos, nStored == 0);
             EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
             RouterConf read = {};
+            gLog.clear();
             fnArm();
             const int nRead = TLibGetRouterConf("192.168.1.1", &read, nullptr, true);
             gNGoodAllocations = -1;
+            EXPECT_TRUE(nRead == 0 || !gLog.empty());
             EXPECT_TRUE(nRead == (szNow.empty() ? 1 : 0) || (gBlAllocationFailed && nRead == -1)) << nRead;
             EXPECT_EQ(Read(kRouterConf), szNow);
             EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));

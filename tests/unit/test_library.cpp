@@ -363,10 +363,12 @@ TEST_F(Library, MemoryThatRunsOutIsNoSuccess) {
     for (const auto& one : rgCases) {
         int nFailures = 0;
         RunOutOfMemory([&](const auto& fnArm) {
+            gLog.clear();
             fnArm();
             const int nResult = one.fnCall();
             gNGoodAllocations = -1;
             EXPECT_EQ(nResult, gBlAllocationFailed ? one.nBad : one.nGood) << one.szWhat;
+            EXPECT_EQ(gLog.empty(), !gBlAllocationFailed) << one.szWhat;
             nFailures += gBlAllocationFailed ? 1 : 0;
         });
         EXPECT_GT(nFailures, 0) << one.szWhat;
@@ -599,8 +601,8 @@ TEST_F(Library, SettingsThatCannotBeGoneOnWithBeginAnew) {
         gNGoodAllocations = -1;
         said.insert(gLog);
     });
-    EXPECT_TRUE(said.contains({"hash malloc failed", szAnew}));
-    EXPECT_TRUE(said.contains({"hash malloc failed", "create a new section failed"}));
+    EXPECT_TRUE(said.contains({"has run out in TLIBCSzHashAlloc()", "hash malloc failed", szAnew}));
+    EXPECT_TRUE(said.contains({"has run out in TLIBCSzHashAlloc()", "hash malloc failed", "create a new section failed"}));
 }
 
 TEST_F(Library, RouterNames) {

@@ -350,7 +350,7 @@ TEST_F(RelayService, MemoryThatRunsOutLosesNoRule) {
         fnArm();
         const int nResult = Set("hop", rgRequests, true);
         gNGoodAllocations = -1;
-        EXPECT_TRUE(nResult == 0 || (nResult == -1 && gBlAllocationFailed)) << nResult;
+        EXPECT_TRUE(nResult == 0 || (nResult == -1 && gBlAllocationFailed && !gLog.empty())) << nResult;
         EXPECT_TRUE((nResult != 0 && Read(kRuleConf) == szOld) ||
                     Kept() == "1 E tcp 80 80; 2 D tcp 82 82 hop; 3 E tcp 83 83 hop")
             << Read(kRuleConf);
