@@ -10,9 +10,12 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <ctime>
+#include <exception>
 #include <memory>
 
 #include "ground/Descriptor.h"
+#include "ground/Directory.h"
 #include "ground/Fail.h"
 #include "ground/Suffix.h"
 #include "ground/SysLog.h"
@@ -311,7 +314,29 @@ bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t 
     if (!file.Rename(szTarget)) {
         return Fail(TLIBC_ERR_RENAME, false);
     }
+    DropLeftovers(szDir, std::string_view(szTarget).substr(szTarget.rfind('/') + 1));
     return FlushDirectory(szDir);
+}
+
+void DropLeftovers(const std::string& szDir, std::string_view szFile) noexcept {
+    try {
+        struct stat status = {};
+        const bool blOurs = stat(szDir.c_str(), &status) == 0 && (status.st_mode & S_ISVTX) == 0;
+        const auto rgszNames = blOurs ? NamesIn(szDir) : std::nullopt;
+        for (const std::string& szName : rgszNames ? *rgszNames : std::vector<std::string>()) {
+            const size_t nDot = szName.rfind('.');
+            if (nDot == std::string::npos || !IsSuffix(std::string_view(szName).substr(nDot + 1)) ||
+                (!szFile.empty() && szFile != std::string_view(szName).substr(0, nDot))) {
+                continue;
+            }
+            const std::string szPath = szDir + "/" + szName;
+            if (lstat(szPath.c_str(), &status) == 0 && S_ISREG(status.st_mode) &&
+                time(nullptr) - status.st_ctim.tv_sec > kWriterSeconds && unlink(szPath.c_str()) == 0) {
+                SysLog(LOG_WARNING, "%s, which a killed writer had begun, is deleted", szPath.c_str());
+            }
+        }
+    } catch (const std::exception&) {  // the next one does it
+    }
 }
 
 bool FlushDirectoryOf(const std::string& szPath) {

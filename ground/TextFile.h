@@ -43,6 +43,14 @@ std::optional<std::string> ReadFile(const std::string& szPath, size_t nMost = TL
 bool WriteFileAtomic(const std::string& szPath, std::string_view szText, mode_t nNewMode = kPrivateMode,
                      const std::function<bool(int fd)>& fnWhole = nullptr, size_t nMost = TLIBC_MAX_FILE);
 
+// A writer that lives is done by then with what it has begun or moved aside.
+inline constexpr time_t kWriterSeconds = 600;
+
+// Deletes what writers that were killed had begun to write in that directory: it may hold a password. szFile: only of
+// that file, where the directory is not ours alone; empty: of any. What is younger stays, and so does what a person has
+// named, and what lies where everybody may write and the next boot deletes it.
+void DropLeftovers(const std::string& szDir, std::string_view szFile = "") noexcept;
+
 // What was made, renamed and deleted in the directory that the path leads into is there, or gone, after a power cut.
 // False with the last error set. A file system that flushes no directories is none that fails.
 bool FlushDirectoryOf(const std::string& szPath);

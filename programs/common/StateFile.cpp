@@ -9,6 +9,7 @@
 namespace tavo {
 
 const std::string& StateFile::Read() {
+    DropLeftovers(DirectoryOf(mSzPath));
     mSzWritten = ReadFile(mSzPath, mNMost).value_or("");
     return mSzWritten;
 }

@@ -19,6 +19,7 @@
 #include "ground/Rename.h"
 #include "ground/Suffix.h"
 #include "ground/SysLog.h"
+#include "ground/TextFile.h"
 
 namespace tavo {
 
@@ -26,15 +27,13 @@ namespace {
 
 constexpr std::string_view kRouterName = "router.conf";
 constexpr std::string_view kRouterConf = "/etc/portforward/router.conf";
-constexpr time_t kObsoleteSeconds = 600;  // since it was moved aside; a write takes a second
-constexpr time_t kStandInSeconds = 10;    // within which a report has put its own settings in the place of the user's
+constexpr time_t kStandInSeconds = 10;  // within which a report has put its own settings in the place of the user's
 
 enum class Kind {
     kNone,      // none of ours
     kAside,     // what a writer moved aside, to the file's name and a suffix, before writing
     kReported,  // the router's settings that a report has set aside: the suffix begins with a digit
-    kTried,     // what new settings that are only tried stand in for: the name and ".bak", of the router file alone
-    kNew        // what a writer had begun to write: the name, "." and a suffix
+    kTried      // what new settings that are only tried stand in for: the name and ".bak", of the router file alone
 };
 
 struct AsideCopy {
@@ -50,9 +49,6 @@ Kind KindOf(std::string_view szSeen, std::string_view szName) {
     szSeen.remove_prefix(szName.size());
     if (szSeen == ".bak") {
         return szName == kRouterName ? Kind::kTried : Kind::kNone;
-    }
-    if (szSeen.starts_with('.')) {
-        return IsSuffix(szSeen.substr(1)) ? Kind::kNew : Kind::kNone;
     }
     if (!IsSuffix(szSeen)) {
         return Kind::kNone;
@@ -88,10 +84,8 @@ bool IsHeld(const AsideCopy& copy) {
     return fd.Get() < 0 || fcntl(fd.Get(), F_OFD_GETLK, &other) != 0 || other.l_type != F_UNLCK;
 }
 
-// Whether one copy has less to say than the other; what is half written has nothing.
-bool IsWorse(const AsideCopy& one, const AsideCopy& other) {
-    const bool blHalf = one.enKind == Kind::kNew;
-    return blHalf != (other.enKind == Kind::kNew) ? blHalf : IsOlder(one.status.st_mtim, other.status.st_mtim);
+bool WasWrittenBefore(const AsideCopy& one, const AsideCopy& other) {
+    return IsOlder(one.status.st_mtim, other.status.st_mtim);
 }
 
 // Whether what is live now was written after a report had put its own settings there: by a person, by hand.
@@ -123,6 +117,18 @@ void BringBackReported(const char* szPath, const std::vector<AsideCopy>& rgCopie
     }
 }
 
+// Whether nobody will want the copy back, once the live file is newer.
+bool IsLeft(const AsideCopy& copy, const struct stat& live) {
+    switch (copy.enKind) {
+        case Kind::kReported:
+            return IsNewer(live, copy) && !IsHeld(copy);
+        case Kind::kTried:
+            return !IsHeld(copy);
+        default:
+            return true;
+    }
+}
+
 bool IsThere(const char* szPath) {
     struct stat live = {};
     return lstat(szPath, &live) == 0;
@@ -140,8 +146,8 @@ bool BringBack(const char* szPath) {
     if (IsThere(szPath)) {
         return true;
     }
-    const auto newest = std::max_element(rgCopies.begin(), rgCopies.end(), &IsWorse);
-    if (newest == rgCopies.end() || newest->enKind == Kind::kNew) {
+    const auto newest = std::max_element(rgCopies.begin(), rgCopies.end(), &WasWrittenBefore);
+    if (newest == rgCopies.end()) {
         return true;
     }
     if (blRouter && IsHeld(*newest)) {  // nobody sets rules aside for longer: who has a lock on them only reads
@@ -172,10 +178,8 @@ void DropObsolete(const char* szPath) {
     for (const AsideCopy& copy : rgCopies) {
         struct stat link = {};
         const bool blPlain = lstat(copy.szPath.c_str(), &link) == 0 && S_ISREG(link.st_mode);
-        const bool blObsolete = copy.enKind == Kind::kNew || IsOlder(copy.status.st_mtim, live.st_mtim);
-        const bool blWriters =
-            copy.enKind == Kind::kNew || copy.enKind == Kind::kAside || (IsNewer(live, copy) && !IsHeld(copy));
-        if (blPlain && blWriters && blObsolete && nNow - copy.status.st_ctim.tv_sec > kObsoleteSeconds &&
+        const bool blObsolete = IsOlder(copy.status.st_mtim, live.st_mtim) && IsLeft(copy, live);
+        if (blPlain && blObsolete && nNow - copy.status.st_ctim.tv_sec > kWriterSeconds &&
             unlink(copy.szPath.c_str()) == 0) {
             SysLog(LOG_WARNING, "%s, which a killed writer left beside %s, is deleted", copy.szPath.c_str(), szPath);
         }

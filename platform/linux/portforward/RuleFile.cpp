@@ -53,6 +53,7 @@ void EmptyOut(const char* szPath) {
 
 TAVO_PF_CONF* Load(const char* szPath) {
     return AtBorder(static_cast<TAVO_PF_CONF*>(nullptr), [&] {
+        tavo::DropLeftovers(tavo::DirectoryOf(szPath));
         tavo::BringBack(szPath);
         ConfList pList = tavo::LoadConfList(szPath);
         // A writer may be moving the file aside again and again, and a single look may find neither file nor
@@ -64,7 +65,10 @@ TAVO_PF_CONF* Load(const char* szPath) {
             pList = tavo::LoadConfList(szPath);
         }
         if (TLIBCErrGet() == TLIBC_ERR_NONE) {
-            tavo::DropObsolete(szPath);
+            // Settings that say nothing make way for those of before, which must be there then; "no rules" is a wish.
+            if (pList || std::string_view(szPath) != kRouterConf) {
+                tavo::DropObsolete(szPath);
+            }
             if (!pList) {
                 EmptyOut(szPath);
                 SetError(TLIBC_ERR_NONE);
