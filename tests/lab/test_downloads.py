@@ -3,6 +3,7 @@ import glob
 import io
 import os
 import shutil
+import signal
 import subprocess
 import tarfile
 import time
@@ -52,6 +53,15 @@ def archive(*members):
             info.size, info.type, info.linkname = len(text), kind, link
             tar.addfile(info, io.BytesIO(text))
     return out.getvalue()
+
+
+def kill_tree(pid):
+    """The process and what it has started, without a chance to tidy up."""
+    with open(f"/proc/{pid}/task/{pid}/children", encoding="ascii") as file:
+        below = file.read().split()
+    os.kill(pid, signal.SIGKILL)
+    for child in below:
+        kill_tree(int(child))
 
 
 class Downloads(unittest.TestCase):
@@ -135,6 +145,24 @@ class Downloads(unittest.TestCase):
                 self.unchanged()
                 if why:
                     self.assertRegex(update_in_words(), f"{WAN}:800./{fault}/routerdb.tgz: .*({why})")
+
+    def test_one_that_is_killed_leaves_the_old_file_and_nothing_for_good(self):
+        for name, fault in (("router_upnp.db", "stalls"), ("router_upnp.db", "endless"), ("routersdk_version", "stalls")):
+            with self.subTest(name=name, fault=fault):
+                begun = f"/etc/portforward/{name}.download.*"
+                sh = LAB.start("box", "/usr/tavo/bin/wget", f"http://{WAN}:8000/{fault}/{name}", "-O",
+                               f"/etc/portforward/{name}")
+                wait_for(lambda: any(os.path.getsize(path) >= (fault == "endless") for path in glob.glob(begun)
+                                     if not path.endswith(".why")) and glob.glob(f"{begun}.why"), 10, "it has begun")
+                kill_tree(sh.pid)
+                sh.wait()
+                left = glob.glob("/etc/portforward/*.download.*")
+                self.unchanged(*(path[len("/etc/portforward"):] for path in left))
+                for path in left:
+                    os.utime(path, (0, 0))
+        self.serve_from("good")
+        self.assertEqual(update_upnp(), (1, 1))
+        self.assertEqual(glob.glob("/etc/portforward/*.download.*"), [])
 
     def test_archives_that_mean_harm(self):
         LAB.write("/tmp/victim", "untouched")
