@@ -20,6 +20,7 @@
 #include "programs/common/IgdRouter.h"
 #include "programs/common/MadeFile.h"
 #include "programs/upnpd/TestMappings.h"
+#include "world.h"
 
 namespace {
 
@@ -1417,6 +1418,15 @@ TEST(Record, OfEveryPortIsReadBack) {
     tavo::MadeFile again(kFile);
     again.Get().TurnTo({"192.168.100.100", "aa:bb:cc:dd:ee:ff"});
     EXPECT_EQ(again.Get().Here().size(), 2U * 65535U);
+    // What has not changed is not written: neither what was read nor what was saved.
+    ino_t nWritten = InodeOf(kFile);
+    EXPECT_TRUE(again.Save());
+    EXPECT_EQ(InodeOf(kFile), nWritten);
+    again.Get().Here().erase({"TCP", 1});
+    EXPECT_TRUE(again.Save());
+    EXPECT_NE(InodeOf(kFile), std::exchange(nWritten, InodeOf(kFile)));
+    EXPECT_TRUE(again.Save());
+    EXPECT_EQ(InodeOf(kFile), nWritten);
     std::remove(kFile);
 }
 

@@ -234,13 +234,20 @@ TEST(SectionedFile, WhatNoReaderTakesIsNotWritten) {
     TLIBCSzHash* pHash = TLIBCSzHashAlloc(1);
     TLIBCSzHashSetValue(pHash, "k", szHuge.c_str());
     TAVO_PF_CONF conf = {"b", pHash, nullptr};
-    const std::function<int()> rgWrites[] = {[&] { return TLIBCFileAddSection(kPath, "b", pHash, 0); },
-                                             [&] { return TAVOPFRuleBuildByPath(&conf, kPath); },
-                                             [&] { return TLIBCFileSetKeyValue(kPath, "k", szHuge.c_str(), nullptr); }};
-    for (const auto& fnWrite : rgWrites) {
+    std::vector<TAVO_PF_CONF> rgMany(TAVO_PF_MAX_SECTIONS + 1, TAVO_PF_CONF{"b", nullptr, nullptr});
+    for (size_t i = 1; i < rgMany.size(); ++i) {
+        rgMany[i - 1].pNext = &rgMany[i];
+    }
+    const std::pair<std::function<int()>, int> rgWrites[] = {
+        {[&] { return TLIBCFileAddSection(kPath, "b", pHash, 0); }, TLIBC_ERR_WRITE},
+        {[&] { return TAVOPFRuleBuildByPath(&conf, kPath); }, TLIBC_ERR_WRITE},
+        {[&] { return TLIBCFileSetKeyValue(kPath, "k", szHuge.c_str(), nullptr); }, TLIBC_ERR_WRITE},
+        {[&] { return TAVOPFRuleBuildByPath(rgMany.data(), kPath); }, TLIBC_ERR_BAD_PARAMETER}};
+    EXPECT_EQ(TAVOPFRuleBuildByPath(&rgMany[1], kPath), 0) << "as many as are read again";
+    for (const auto& [fnWrite, nErr] : rgWrites) {
         Write(kPath, szOld);
         EXPECT_LT(fnWrite(), 0);
-        EXPECT_EQ(TLIBCErrGet(), TLIBC_ERR_WRITE);
+        EXPECT_EQ(TLIBCErrGet(), nErr);
         EXPECT_TRUE(Read(kPath) == szOld);
     }
     TLIBCSzHashFree(pHash);

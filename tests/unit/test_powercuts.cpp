@@ -256,8 +256,10 @@ Store Plain(const char* szName, const std::function<bool(const char*)>& fnWrite,
     return {szName, fnBefore, [=] { return fnWrite(szNew); }, pfnRead, szOld, szNew, szMeanwhile, blSilent};
 }
 
-// Two files are deleted before they are written, by an old format; whoever finds nothing asks the router anew. Settings
-// that are tried stand there until they turn out to be of no use.
+// Two files are deleted before they are written, and may be missing until then: what is told of the router that was
+// before must not outlive a write that fails (the detection's cache), and the newest record is the only one there is (a
+// test's result). Whoever finds nothing asks the router, or tests it, anew. Settings that are tried stand there until
+// they turn out to be of no use.
 const std::vector<Store>& Stores() {
     static const auto fnOldSettings = [] { SetSettings("no", "old"); };
     static const auto fnOldTool = [] {

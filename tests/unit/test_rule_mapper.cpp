@@ -271,6 +271,9 @@ TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
     gSzGateway.clear();
     mapper.Pass();
     EXPECT_EQ(Result(), "80/tcp nogateway\n1-2/tcp invalid\nrule.conf unreadable\n");
+    const ino_t nWritten = InodeOf(kNames.szResultFile);
+    mapper.Pass();
+    EXPECT_EQ(InodeOf(kNames.szResultFile), nWritten) << "a box that has nothing to do lets its disks sleep";
     gSzGateway = "192.168.1.1";
     gSzBox = "192.168.1.6";
     mapper.TakeCalls();

@@ -146,6 +146,12 @@ inline std::string Read(const std::string& szPath) {
     return text.str();
 }
 
+// Another one after every write that replaces the file.
+inline ino_t InodeOf(const std::string& szPath) {
+    struct stat status = {};
+    return stat(szPath.c_str(), &status) == 0 ? status.st_ino : 0;
+}
+
 inline bool Logged(const std::string& szLine) {
     return std::find(gLog.begin(), gLog.end(), szLine) != gLog.end();
 }
