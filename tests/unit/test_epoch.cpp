@@ -1,5 +1,11 @@
-// When a gateway's "seconds since start" says that it has lost its mappings.
+// When a gateway's "seconds since start" says that it has lost its mappings, and the clock that this is held against.
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <fstream>
 
 #include "programs/natpmpd/EpochWatch.h"
 
@@ -29,6 +35,33 @@ TEST(EpochWatch, AnEighthSlowOrTwoSecondsOffIsNoRestart) {
         EXPECT_EQ(watch.TakeRestart(), one.blRestart) << "and is not forgotten before it is asked for";
         EXPECT_FALSE(watch.TakeRestart());
     }
+}
+
+// A box that sleeps does not run, and its router's leases do. Here it slept two hours, as a namespace of times has it.
+TEST(BootClock, GoesOnWhileTheBoxSleeps) {
+    enum : int { kCounts = 1, kDoesNot, kNoNamespaces, kBroken };
+    const pid_t pid = fork();
+    if (pid == 0) {
+        const int64_t nBefore = tavo::BootSeconds();
+        if (unshare(CLONE_NEWTIME) != 0) {
+            _exit(errno == EINVAL ? kNoNamespaces : kBroken);
+        }
+        if (!(std::ofstream("/proc/self/timens_offsets") << "boottime 7200 0" << std::flush)) {
+            _exit(kBroken);
+        }
+        if (fork() == 0) {  // the one that has its times
+            _exit(tavo::BootSeconds() - nBefore >= 7200 ? kCounts : kDoesNot);
+        }
+        int nStatus = 0;
+        wait(&nStatus);
+        _exit(WEXITSTATUS(nStatus));
+    }
+    int nStatus = 0;
+    ASSERT_EQ(waitpid(pid, &nStatus, 0), pid);
+    if (WEXITSTATUS(nStatus) == kNoNamespaces) {
+        GTEST_SKIP() << "this kernel has no namespaces of times: whether the clock goes on in a sleep is not looked at";
+    }
+    EXPECT_EQ(WEXITSTATUS(nStatus), kCounts);
 }
 
 }  // namespace
