@@ -34,6 +34,8 @@ struct Network {
     std::function<void()> fnAnnounce;  // what else happens when avahi restarts
 };
 extern Network* gPNetwork;
+// This box's address towards the gateway; empty: the real platform tells.
+extern std::string gSzBox;
 
 // The router's table and the box's interfaces, while a test has them.
 struct Home {

@@ -29,8 +29,7 @@ extern "C" {
 time_t time(time_t* pTime) {
     timespec now = {};
     clock_gettime(CLOCK_REALTIME, &now);
-    const time_t nNow = now.tv_sec + gNClockAhead;
-    return pTime == nullptr ? nNow : *pTime = nNow;
+    return pTime == nullptr ? now.tv_sec : *pTime = now.tv_sec;
 }
 }
 

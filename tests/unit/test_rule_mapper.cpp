@@ -14,11 +14,7 @@
 #include "tavo/net.h"
 #include "world.h"
 
-namespace {
-
-std::string gSzBox;  // this box's address; empty: the real platform tells
-
-}  // namespace
+std::string gSzBox;
 
 extern "C" int TAVONetLocalAddressGet(const char* szPeer, char* szLocal, int nSize, char* szInterface, int nOther) {
     if (gSzBox.empty()) {

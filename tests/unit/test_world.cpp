@@ -109,6 +109,7 @@ int clock_gettime(clockid_t nClock, timespec* pTime) {
     static const auto fnReal = Real("clock_gettime", &clock_gettime);
     const int nResult = fnReal(nClock, pTime);
     pTime->tv_sec += gNClockJumped += gNClockStep;
+    pTime->tv_sec += nClock == CLOCK_REALTIME ? gNClockAhead : 0;
     return nResult;
 }
 

@@ -43,7 +43,7 @@ extern std::function<void()> gFnOnSleep;
 // Answers in place of the platform's write of router.conf, when set.
 extern std::function<int()> gFnOnConfSet;
 
-// What time() is ahead of the real clock, in seconds.
+// What the time of day is ahead of the real clock, in seconds; no other clock is.
 extern time_t gNClockAhead;
 // Seconds that the clock jumps ahead each time somebody looks at it.
 extern int gNClockStep;
