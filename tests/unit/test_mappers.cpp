@@ -1,0 +1,303 @@
+// The mapping side of a daemon at a router on the loopback device: what it asks for, and when anew.
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <atomic>
+#include <mutex>
+#include <thread>
+
+#include "ground/Descriptor.h"
+#include "network.h"
+#include "programs/natpmpd/NatpmpMapper.h"
+#include "tavo/core.h"
+#include "world.h"
+
+namespace {
+
+using Lines = std::vector<std::string>;
+
+constexpr char kGateway[] = "192.168.78.1";
+constexpr char kBox[] = "192.168.78.5";
+constexpr char kNewBox[] = "192.168.78.6";
+constexpr char kRules[] = "/etc/portforward/rule.conf";
+constexpr char kSystem[] = "/etc/tavoinfo.conf";
+constexpr uint16_t kSsdpPort = 1900;
+
+sockaddr_in AddressOf(const char* szAddress, uint16_t nPort) {
+    sockaddr_in address = {};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(nPort);
+    inet_pton(AF_INET, szAddress, &address.sin_addr);
+    return address;
+}
+
+tavo::Descriptor SocketAt(const char* szAddress, uint16_t nPort, int nKind = SOCK_DGRAM) {
+    tavo::Descriptor fd(socket(AF_INET, nKind | SOCK_CLOEXEC, 0));
+    const sockaddr_in own = AddressOf(szAddress, nPort);
+    EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
+    return fd;
+}
+
+void Send(const tavo::Descriptor& fd, const std::string& szText, const sockaddr_in& to) {
+    EXPECT_EQ(sendto(fd.Get(), szText.data(), szText.size(), 0, reinterpret_cast<const sockaddr*>(&to), sizeof(to)),
+              static_cast<ssize_t>(szText.size()));
+}
+
+// Of the gateway's, to all that listen.
+void SayToAll(const char* szGroup, uint16_t nPort, const std::string& szText) {
+    const tavo::Descriptor fd = SocketAt(kGateway, 0);
+    const in_addr own = AddressOf(kGateway, 0).sin_addr;
+    setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &own, sizeof(own));
+    Send(fd, szText, AddressOf(szGroup, nPort));
+}
+
+class MapperTest : public testing::Test {
+protected:
+    explicit MapperTest(std::string szRunKey) : mSzRunKey(std::move(szRunKey)) {
+        for (const char* szAddress : {kGateway, kBox, kNewBox}) {
+            EXPECT_EQ(TLIBCSystem((std::string("ip address add dev lo ") + szAddress).c_str()), 0);
+        }
+    }
+    ~MapperTest() override {
+        for (const char* szAddress : {kGateway, kBox, kNewBox}) {
+            TLIBCSystem((std::string("ip address del dev lo ") + szAddress + "/32 2>/dev/null").c_str());
+        }
+    }
+    void SetUp() override {
+        MakeEmpty({"/var/lib/tavo", "/run/tavo"});
+        std::filesystem::remove("/etc/tavo/platform.conf");
+        gSzGateway = kGateway;
+        gSzBox = kBox;
+        gPNetwork = &mNetwork;
+        Switch(true);
+    }
+    void TearDown() override {
+        MakeEmpty({"/var/lib/tavo", "/run/tavo"});
+        std::filesystem::remove(kRules);
+        std::filesystem::remove(kSystem);
+        gSzGateway = "192.168.1.1";
+        gSzBox.clear();
+        gPNetwork = nullptr;
+        gNClockAhead = 0;
+    }
+    void Switch(bool blOn) const { Write(kSystem, mSzRunKey + "=\"" + (blOn ? "yes" : "no") + "\"\n"); }
+    // One for each, from the router's port or range to the box's.
+    using Rules = std::vector<std::pair<const char*, const char*>>;
+    static void SetRules(const Rules& rgRules) {
+        std::string szText;
+        for (const auto& [szRouter, szBox] : rgRules) {
+            szText += std::string("[") + szRouter + "]\nenabled=1\nprotocol name=tcp\nr_port=" + szRouter +
+                      "\ns_port=" + szBox + "\nservice=web\n";
+        }
+        Write(kRules, szText);
+    }
+    static int Pass(tavo::RuleMapper& mapper, bool blRequested = false) {
+        return mapper.Run(blRequested, [] { return false; });
+    }
+
+    std::string mSzRunKey;
+    Network mNetwork;
+    JumpingClock mClock;
+};
+
+// Grants what it is asked for, and says how long it has run as the test has it.
+class NatpmpGateway {
+public:
+    ~NatpmpGateway() {
+        mBlEnd = true;
+        mThread.join();
+    }
+    // What was asked of it beside its address; what was sent again for want of an answer counts once.
+    Lines TakeAsked() {
+        const std::lock_guard guard(mMutex);
+        mRgszAsked.erase(std::unique(mRgszAsked.begin(), mRgszAsked.end()), mRgszAsked.end());
+        return std::exchange(mRgszAsked, {});
+    }
+    std::atomic<uint32_t> mNEpoch = 1000;
+    std::atomic<uint16_t> mNBeside = 0;  // so far from the port that it was asked for
+
+private:
+    void Serve() {
+        for (pollfd waiting = {mFd.Get(), POLLIN, 0}; !mBlEnd;) {
+            uint8_t rgAsked[64];
+            sockaddr_in from = {};
+            socklen_t nLength = sizeof(from);
+            if (poll(&waiting, 1, 10) > 0 &&
+                recvfrom(mFd.Get(), rgAsked, sizeof(rgAsked), 0, reinterpret_cast<sockaddr*>(&from), &nLength) > 0) {
+                Send(mFd, Answer(rgAsked, from), from);
+            }
+        }
+    }
+    static std::string Bytes(uint32_t nNumber, int nBytes) {
+        std::string szBytes;
+        for (int i = nBytes - 1; i >= 0; --i) {
+            szBytes += static_cast<char>(nNumber >> (8 * i));
+        }
+        return szBytes;
+    }
+    std::string Answer(const uint8_t* pAsked, const sockaddr_in& from) {
+        const std::string szHead = Bytes((128U + pAsked[1]) << 16U, 4);
+        if (pAsked[1] == 0) {
+            return szHead + Bytes(mNEpoch, 4) + Bytes(0xC6290004, 4);
+        }
+        const auto fnNumber = [pAsked](int nAt) { return uint32_t{pAsked[nAt]} << 8U | pAsked[nAt + 1]; };
+        const uint32_t nLease = fnNumber(8) << 16U | fnNumber(10);
+        char szFrom[INET_ADDRSTRLEN] = {};
+        inet_ntop(AF_INET, &from.sin_addr, szFrom, sizeof(szFrom));
+        const std::lock_guard guard(mMutex);
+        std::string szAsked = std::to_string(fnNumber(4));
+        szAsked += nLease == 0 ? " ends" : " at " + std::to_string(fnNumber(6)) + " for " + std::to_string(nLease);
+        if (std::string(szFrom) != kGateway) {  // which the kernel takes for who does not say
+            szAsked += std::string(" by ") + szFrom;
+        }
+        mRgszAsked.push_back(szAsked);
+        return szHead + Bytes(mNEpoch, 4) + Bytes(fnNumber(4), 2) + Bytes(nLease == 0 ? 0 : fnNumber(6) + mNBeside, 2) +
+               Bytes(nLease, 4);
+    }
+
+    tavo::Descriptor mFd = SocketAt(kGateway, tavo::kGatewayPort);
+    std::mutex mMutex;
+    Lines mRgszAsked;
+    std::atomic<bool> mBlEnd = false;
+    std::thread mThread{[this] { Serve(); }};
+};
+
+class NatpmpMapping : public MapperTest {
+protected:
+    NatpmpMapping() : MapperTest("runnatpmpportmapping") { SetRules({{"80", "8080"}}); }
+    // So long after the last pass, by every clock but that of the day.
+    void After(int nSeconds) {
+        gNClockJumped += nSeconds;
+        mGateway.mNEpoch += static_cast<uint32_t>(nSeconds);
+    }
+    static std::string Result() { return Read(tavo::kNatpmpNames.szResultFile); }
+    NatpmpGateway mGateway;
+};
+
+const Lines kAsked{"8080 at 80 for 3600"};
+constexpr char kNatpmpMade[] = "/var/lib/tavo/natpmp_made.conf";
+
+TEST_F(NatpmpMapping, AGatewayThatHasBegunAnewIsAskedForAllAgain) {
+    struct Case {
+        const char* szWhat;
+        int nSeconds;  // since the one before
+        uint32_t nEpoch;
+        bool blAsked;
+        int nNext;
+    };
+    const Case rgCases[] = {{"the first", 0, 1000, true, 10},
+                            {"it goes on", 10, 1010, false, 10},
+                            {"it goes on", 10, 1020, false, 20},
+                            {"it has begun anew", 20, 12, true, 10},
+                            {"it goes on", 10, 22, false, 10},
+                            {"it has just begun anew", 20, 3, true, 10},
+                            {"so young that it may have begun once more", 3, 4, true, 10},
+                            {"and once more", 3, 7, true, 10},
+                            {"which this looks at for the last time", 10, 17, true, 40},
+                            {"it goes on", 10, 27, false, 80}};
+    tavo::NatpmpMapper mapper;
+    for (const Case& one : rgCases) {
+        gNClockJumped += one.nSeconds;
+        mGateway.mNEpoch = one.nEpoch;
+        EXPECT_EQ(Pass(mapper, &one == rgCases), one.nNext) << one.szWhat << " " << one.nEpoch;
+        EXPECT_EQ(mGateway.TakeAsked(), one.blAsked ? kAsked : Lines()) << one.szWhat << " " << one.nEpoch;
+        EXPECT_EQ(Result(), "");
+    }
+    for (const auto& [cEpoch, blNews] : {std::pair('\36', false), {'\2', true}}) {  // held against its last answer
+        SayToAll("224.0.0.1", 5350, std::string("\0\200\0\0\0\0\0", 7) + cEpoch + "addr");
+        EXPECT_EQ(mapper.OnWake(), blNews);
+    }
+}
+
+// Else a neighbour could have the box ask, and its disk write, without end.
+TEST_F(NatpmpMapping, WhatAnybodyCanSayMakesAllDoubtfulOnceInTenMinutes) {
+    const auto longAgo = std::filesystem::file_time_type::clock::now() - std::chrono::hours(9000);
+    tavo::NatpmpMapper mapper;
+    Pass(mapper, true);
+    mGateway.TakeAsked();
+    for (const auto& [nSeconds, szLife, blDoubt] :
+         {std::tuple(5, "1", true), {5, "2", false}, {590, "3", false}, {5, "4", true}, {5, "5", false}}) {
+        After(nSeconds);
+        std::filesystem::last_write_time(kNatpmpMade, longAgo);
+        SayToAll("239.255.255.250", kSsdpPort,
+                 std::string("NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: u\r\nBOOTID.UPNP.ORG: ") + szLife);
+        EXPECT_TRUE(mapper.OnWake()) << szLife;
+        Pass(mapper);
+        EXPECT_EQ(mGateway.TakeAsked(), blDoubt ? kAsked : Lines()) << szLife;
+        EXPECT_EQ(std::filesystem::last_write_time(kNatpmpMade) != longAgo, blDoubt) << szLife;
+    }
+    EXPECT_FALSE(mapper.OnWake());
+}
+
+TEST_F(NatpmpMapping, AnotherPortIsGivenBackAndNotAskedForUntilSomebodyWantsIt) {
+    mGateway.mNBeside = 1;
+    tavo::NatpmpMapper mapper;
+    for (const bool blRequested : {true, false, true}) {
+        Pass(mapper, blRequested);
+        EXPECT_EQ(mGateway.TakeAsked(), blRequested ? (Lines{kAsked[0], "8080 ends"}) : Lines());
+        EXPECT_EQ(Result(), "80/tcp (the router offered 81)");
+        EXPECT_EQ(Read(kNatpmpMade), "") << "nothing is left of it";
+    }
+    mGateway.mNBeside = 0;
+    Pass(mapper, true);
+    EXPECT_EQ(mGateway.TakeAsked(), kAsked);
+    EXPECT_EQ(Result(), "");
+}
+
+// The gateway knows its clients by their addresses.
+TEST_F(NatpmpMapping, WhatLedToAFormerAddressIsTakenAwayFromThereOrWaitedFor) {
+    for (const bool blHas : {true, false}) {
+        MakeEmpty({"/var/lib/tavo"});
+        gSzBox = kBox;
+        tavo::NatpmpMapper mapper;
+        Pass(mapper, true);
+        EXPECT_EQ(mGateway.TakeAsked(), kAsked);
+        gSzBox = kNewBox;
+        if (!blHas) {
+            ASSERT_EQ(TLIBCSystem((std::string("ip address del dev lo ") + kBox + "/32").c_str()), 0);
+        }
+        Pass(mapper);
+        EXPECT_EQ(mGateway.TakeAsked(), blHas ? (Lines{std::string("8080 ends by ") + kBox, kAsked[0]}) : Lines());
+        EXPECT_EQ(Result(), blHas ? "" : "80/tcp (the router keeps it for this box's former address 192.168.78.5)");
+    }
+}
+
+// Leases run by the clock of the boot, as the router's do.
+TEST_F(NatpmpMapping, AClockThatIsSetChangesNothing) {
+    struct Case {
+        int nAhead;
+        bool blBoth;  // rules; else the first
+        bool blRequested;
+        Lines rgszAsked;
+    };
+    const Lines both{kAsked[0], "8081 at 81 for 3600"};
+    const Case rgCases[] = {{0, true, true, both},
+                            {7200, true, false, {}},
+                            {0, true, false, {}},
+                            {-7200, true, false, {}},
+                            {7200, true, true, both},
+                            {0, true, false, {}},
+                            {0, false, true, {"8081 ends", kAsked[0]}},
+                            {7200, false, false, {}}};
+    tavo::NatpmpMapper mapper;
+    for (const Case& one : rgCases) {
+        After(10);
+        gNClockAhead = one.nAhead;
+        Rules rgRules{{"80", "8080"}, {"81", "8081"}};
+        rgRules.resize(one.blBoth ? 2 : 1);
+        SetRules(rgRules);
+        Pass(mapper, one.blRequested);
+        EXPECT_EQ(mGateway.TakeAsked(), one.rgszAsked) << &one - rgCases;
+        EXPECT_EQ(Result(), "");
+    }
+    gNClockAhead = 0;
+    Switch(false);
+    Pass(mapper, true);
+    EXPECT_EQ(mGateway.TakeAsked(), Lines{"8080 ends"});
+    EXPECT_EQ(Read(kNatpmpMade), "");
+}
+
+}  // namespace
