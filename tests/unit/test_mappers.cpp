@@ -1,4 +1,4 @@
-// The mapping side of a daemon at a router on the loopback device: what it asks for, and when anew.
+// The mapping sides of both daemons, each at a router on the loopback device: what they ask it for, and when anew.
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -6,13 +6,18 @@
 
 #include <algorithm>
 #include <atomic>
+#include <iterator>
+#include <map>
 #include <mutex>
 #include <thread>
 
 #include "ground/Descriptor.h"
 #include "network.h"
 #include "programs/natpmpd/NatpmpMapper.h"
+#include "programs/upnpd/UpnpMapper.h"
 #include "tavo/core.h"
+#include "wire/http/Request.h"
+#include "wire/upnp/GatewayMemory.h"
 #include "world.h"
 
 namespace {
@@ -298,6 +303,218 @@ TEST_F(NatpmpMapping, AClockThatIsSetChangesNothing) {
     Pass(mapper, true);
     EXPECT_EQ(mGateway.TakeAsked(), Lines{"8080 ends"});
     EXPECT_EQ(Read(kNatpmpMade), "");
+}
+
+// A router with one or more lines, each a service with a table.
+class UpnpRouter {
+public:
+    struct Line {
+        std::string szPath;
+        std::string szStatus = "Connected";
+        std::map<std::string, std::string> mapTable = {};  // by the router's port what an answer says of it
+    };
+    explicit UpnpRouter(const Lines& rgszPaths) {
+        for (const std::string& szPath : rgszPaths) {
+            mRgLines.push_back({szPath});
+        }
+        EXPECT_EQ(listen(mFd.Get(), 8), 0);
+        sockaddr_in own = {};
+        socklen_t nLength = sizeof(own);
+        getsockname(mFd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength);
+        mSzPlace = std::string("http://") + kGateway + ":" + std::to_string(ntohs(own.sin_port)) + "/root.xml";
+        mThread = std::thread([this] { Serve(); });
+    }
+    ~UpnpRouter() {
+        mBlEnd = true;
+        mThread.join();
+    }
+    const std::string& Place() const { return mSzPlace; }
+    void SetStatus(size_t nLine, const char* szStatus) {
+        const std::lock_guard guard(mMutex);
+        mRgLines[nLine].szStatus = szStatus;
+    }
+    void Clear() {
+        const std::lock_guard guard(mMutex);
+        mRgLines[0].mapTable.clear();
+    }
+    // What each line has, "80 81,443".
+    std::string Ports() {
+        const std::lock_guard guard(mMutex);
+        std::string szPorts;
+        for (const Line& line : mRgLines) {
+            szPorts += &line == &mRgLines.front() ? "" : ",";
+            for (const auto& [szPort, szEntry] : line.mapTable) {
+                szPorts += (szPorts.empty() || szPorts.back() == ',' ? "" : " ") + szPort;
+            }
+        }
+        return szPorts;
+    }
+    // How often it was asked for what it does not do: a lease, and a range.
+    std::pair<int, int> TakeInVain() { return {mNLeases.exchange(0), mNRanges.exchange(0)}; }
+
+private:
+    void Serve() {
+        for (pollfd waiting = {mFd.Get(), POLLIN, 0}; !mBlEnd;) {
+            if (poll(&waiting, 1, 10) <= 0) {
+                continue;
+            }
+            const tavo::Descriptor fd(accept(mFd.Get(), nullptr, nullptr));
+            tavo::BoundedSocket bounded(fd.Get(), -1);
+            tavo::HttpRequest request;
+            if (request.ReadHead(bounded) == tavo::HttpFault::kNone) {
+                request.ReadBody(bounded);
+                const std::lock_guard guard(mMutex);
+                const auto [nStatus, szXml] = Answer(request);
+                bounded.Write("HTTP/1.1 " + std::to_string(nStatus) + " x\r\nConnection: close\r\nContent-Length: " +
+                              std::to_string(szXml.size()) + "\r\n\r\n" + szXml);
+                bounded.Finish();
+            }
+        }
+    }
+    static std::string Said(const std::string& szText) {
+        return "<Envelope><Body><Answer>" + szText + "</Answer></Body></Envelope>";
+    }
+    static std::pair<int, std::string> Fault(int nCode) {
+        return {500, Said("<Fault><errorCode>" + std::to_string(nCode) + "</errorCode></Fault>")};
+    }
+    std::pair<int, std::string> Answer(const tavo::HttpRequest& request) {
+        if (request.Method() == "GET") {
+            std::string szXml = "<root>";
+            for (const Line& line : mRgLines) {
+                szXml +=
+                    "<service><serviceType>urn:schemas-upnp-org:service:WANIPConnection:2</serviceType><controlURL>" +
+                    line.szPath + "</controlURL></service>";
+            }
+            return {200, szXml + "</root>"};
+        }
+        const auto line = std::find_if(mRgLines.begin(), mRgLines.end(),
+                                       [&](const Line& one) { return one.szPath == request.Path(); });
+        return line == mRgLines.end() ? Fault(401) : Do(*line, request.Body());
+    }
+    std::pair<int, std::string> Do(Line& line, const std::string& szBody) {
+        const auto fnIs = [&](const std::string& szAction) { return szBody.find(":" + szAction + " ") != szBody.npos; };
+        const auto fnValue = [&](const std::string& szName) {
+            const size_t nAt = szBody.find("<" + szName + ">") + szName.size() + 2;
+            return szBody.substr(nAt, szBody.find('<', nAt) - nAt);
+        };
+        const std::string szPort = fnValue("NewExternalPort");
+        if (fnIs("GetStatusInfo")) {
+            return {200, Said("<NewConnectionStatus>" + line.szStatus + "</NewConnectionStatus>")};
+        }
+        if (fnIs("GetExternalIPAddress")) {
+            return {200, Said("<NewExternalIPAddress>198.41.0.4</NewExternalIPAddress>")};
+        }
+        if (fnIs("GetListOfPortMappings")) {
+            ++mNRanges;
+            return Fault(401);
+        }
+        if (fnIs("GetGenericPortMappingEntry")) {
+            const auto nIndex = std::stol(fnValue("NewPortMappingIndex"));
+            return nIndex < std::ssize(line.mapTable)
+                       ? std::pair(200, Said(std::next(line.mapTable.begin(), nIndex)->second))
+                       : Fault(713);
+        }
+        if (fnIs("AddPortMapping")) {
+            if (fnValue("NewLeaseDuration") != "0") {
+                ++mNLeases;
+                return Fault(725);
+            }
+            const size_t nFrom = szBody.find("<NewRemoteHost>");
+            line.mapTable[szPort] = szBody.substr(nFrom, szBody.find("</u:") - nFrom);
+            return {200, Said("")};
+        }
+        const auto it = line.mapTable.find(szPort);
+        if (it == line.mapTable.end()) {
+            return Fault(714);
+        }
+        const std::string szEntry = it->second;
+        if (fnIs("DeletePortMapping")) {
+            line.mapTable.erase(it);
+        }
+        return {200, Said(szEntry)};
+    }
+
+    tavo::Descriptor mFd = SocketAt(kGateway, 0, SOCK_STREAM);
+    std::string mSzPlace;
+    std::mutex mMutex;
+    std::vector<Line> mRgLines;
+    std::atomic<int> mNLeases = 0;
+    std::atomic<int> mNRanges = 0;
+    std::atomic<bool> mBlEnd = false;
+    std::thread mThread;
+};
+
+class UpnpMapping : public MapperTest {
+protected:
+    UpnpMapping() : MapperTest("runupnpportmapping") {}
+    static std::string Result() { return Read(tavo::kUpnpNames.szResultFile); }
+};
+
+TEST_F(UpnpMapping, WhatARouterCannotDoIsRememberedOfItAlone) {
+    const auto fnFront = [](const std::string& szHardware) {
+        return TLIBCSystem((std::string("ip neigh replace ") + kGateway + " dev v0 lladdr " + szHardware).c_str());
+    };
+    ASSERT_EQ(TLIBCSystem("ip link add v0 type veth peer name v1"), 0);
+    ASSERT_EQ(TLIBCSystem("ip link set v0 up"), 0);
+    SetRules({{"5000-5003", "5000-5003"}});
+    UpnpRouter router({"/1"});
+    tavo::KeepRouter(kGateway, {{router.Place(), ""}});
+    const std::tuple<const char*, const char*, int> rgCases[] = {{"new", "00:11:22:aa:bb:01", 1},
+                                                                 {"the same", "00:11:22:aa:bb:01", 0},
+                                                                 {"another one", "00:11:22:aa:bb:02", 1},
+                                                                 {"still there", "00:11:22:aa:bb:02", 0},
+                                                                 {"the first again", "00:11:22:aa:bb:01", 1}};
+    for (const auto& [szWhat, szHardware, nInVain] : rgCases) {
+        ASSERT_EQ(fnFront(szHardware), 0);
+        router.Clear();
+        tavo::UpnpMapper mapper;  // as a start of the box has it
+        Pass(mapper, true);
+        EXPECT_EQ(router.TakeInVain(), std::pair(nInVain, nInVain)) << szWhat;
+        EXPECT_EQ(router.Ports(), "5000 5001 5002 5003") << szWhat << Result();
+    }
+    EXPECT_EQ(TLIBCSystem("ip link del v0"), 0);
+}
+
+TEST_F(UpnpMapping, WhatIsMappedGoesOverToTheLineThatIsUp) {
+    SetRules({{"80", "8080"}});
+    UpnpRouter router({"/1", "/2"});
+    tavo::KeepRouter(kGateway, {{router.Place(), ""}});
+    tavo::UpnpMapper mapper;
+    Pass(mapper, true);
+    EXPECT_EQ(router.Ports(), "80,");
+    router.SetStatus(0, "Disconnected");
+    Pass(mapper);
+    EXPECT_EQ(router.Ports(), ",80");
+    EXPECT_EQ(Result(), "80/tcp=1\n");
+    router.SetStatus(0, "Connected");
+    Pass(mapper);
+    EXPECT_EQ(router.Ports(), ",80") << "the one that is in use stays for as long as it is up";
+}
+
+TEST_F(UpnpMapping, ARouterThatAnswersLateIsFoundByThat) {
+    SetRules({{"80", "8080"}});
+    UpnpRouter router({"/1"});
+    const tavo::Descriptor fdSearched = SocketAt(kGateway, kSsdpPort);
+    tavo::UpnpMapper mapper;
+    mapper.Run(true, [] { return ++gNClockJumped < 0; });
+    EXPECT_EQ(Result(), "80/tcp=noigd\n");
+    char szQuestion[1000];
+    sockaddr_in from = {};
+    socklen_t nLength = sizeof(from);
+    ASSERT_GT(recvfrom(fdSearched.Get(), szQuestion, sizeof(szQuestion), MSG_DONTWAIT,
+                       reinterpret_cast<sockaddr*>(&from), &nLength),
+              0);
+    EXPECT_FALSE(mapper.OnWake());
+    Send(fdSearched, "HTTP/1.1 200 OK\r\nLOCATION: " + router.Place() + "\r\n\r\n", from);
+    const auto rgFds = mapper.WakeFds();
+    EXPECT_TRUE(std::any_of(rgFds.begin(), rgFds.end(), [](int fd) {
+        pollfd waiting = {fd, POLLIN, 0};
+        return poll(&waiting, 1, 0) > 0;
+    }));
+    EXPECT_TRUE(mapper.OnWake());
+    Pass(mapper);
+    EXPECT_EQ(Result(), "80/tcp=1\n");
+    EXPECT_EQ(router.Ports(), "80");
 }
 
 }  // namespace
