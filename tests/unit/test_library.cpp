@@ -602,7 +602,8 @@ TEST_F(Library, SettingsThatCannotBeGoneOnWithBeginAnew) {
         said.insert(gLog);
     });
     EXPECT_TRUE(said.contains({"has run out in TLIBCSzHashAlloc()", "hash malloc failed", szAnew}));
-    EXPECT_TRUE(said.contains({"has run out in TLIBCSzHashAlloc()", "hash malloc failed", "create a new section failed"}));
+    EXPECT_TRUE(
+        said.contains({"has run out in TLIBCSzHashAlloc()", "hash malloc failed", "create a new section failed"}));
 }
 
 TEST_F(Library, RouterNames) {

@@ -1444,8 +1444,8 @@ TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
     for (const bool blAll : {false, true}) {
         Mute router;
         router.blAll = blAll;
-        EXPECT_EQ(Texts(Core().Run(router, Wanted(2))), blAll ? (Rows{"1/tcp 501", "2/tcp 501"})
-                                                              : (Rows{"1/tcp 1 anew", "2/tcp 1 anew"}));
+        EXPECT_EQ(Texts(Core().Run(router, Wanted(2))),
+                  blAll ? (Rows{"1/tcp 501", "2/tcp 501"}) : (Rows{"1/tcp 1 anew", "2/tcp 1 anew"}));
         EXPECT_EQ(router.nAdds, 3);
     }
 }
