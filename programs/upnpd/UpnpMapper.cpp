@@ -33,6 +33,7 @@ void UpnpMapper::NewGateway() {
     KnownRouter known = RecallRouter(Gateway());
     mPlace = std::move(known.place);
     mHabit.blPermanentOnly = known.blPermanentOnly;
+    mHabit.blNoGet = known.blNoGet;
     mHabit.blNoRanges = known.blNoRanges;
     mSzKnownHardware = std::move(known.szHardware);
 }
@@ -71,7 +72,7 @@ void UpnpMapper::Remember() {
     if (const std::string& szHardware = mMade.Get().Router().szHardware; !szHardware.empty()) {
         mSzKnownHardware = szHardware;
     }
-    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mHabit.blNoRanges});
+    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mHabit.blNoGet, mHabit.blNoRanges});
 }
 
 // Another device at the address of the one before has habits of its own.

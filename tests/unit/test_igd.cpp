@@ -747,7 +747,7 @@ TEST_F(SearchTest, AKnownPlaceIsTriedFirstAndOnTheGatewayOnly) {
         gSzGateway = kGateway;
         WebServer server(szPage, kGateway);
         const std::string szKnown = "http://192.168.77.1:" + std::to_string(server.Port()) + "/x";
-        const tavo::KnownRouter known{{szKnown, ""}, "aa", true, true};
+        const tavo::KnownRouter known{{szKnown, ""}, "aa", true, true, true};
         tavo::KeepRouter(kGateway, known);
         std::string szLocal;
         EXPECT_NE(tavo::FindGatewayIgd(300, 0, &szLocal, {}), nullptr);

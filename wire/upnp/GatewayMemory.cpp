@@ -31,6 +31,7 @@ KnownRouter RecallRouter(const std::string& szGateway) {
     return {{fnValue("location"), fnValue("service")},
             fnValue("hardware"),
             fnValue("permanent") == "yes",
+            fnValue("names") == "no",
             fnValue("ranges") == "no"};
 }
 
@@ -39,11 +40,12 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
         return;
     }
     MakeDirectory(kStateDir);
-    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(5), &TLIBCSzHashFree);
+    const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(6), &TLIBCSzHashFree);
     TLIBCSzHashSetValue(pHash.get(), "location", router.place.szLocation.c_str());
     TLIBCSzHashSetValue(pHash.get(), "service", router.place.szControl.c_str());
     TLIBCSzHashSetValue(pHash.get(), "hardware", router.szHardware.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
+    TLIBCSzHashSetValue(pHash.get(), "names", router.blNoGet ? "no" : "yes");
     TLIBCSzHashSetValue(pHash.get(), "ranges", router.blNoRanges ? "no" : "yes");
     if (TLIBCFileAddSection(kStateFile, szGateway.c_str(), pHash.get(), 0) != 1) {
         SysLog(LOG_WARNING, "cannot write %s", kStateFile);

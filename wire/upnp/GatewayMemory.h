@@ -14,6 +14,7 @@ struct KnownRouter {
     IgdPlace place;               // where its service was last found
     std::string szHardware = {};  // of the router that this is true of; empty: not known
     bool blPermanentOnly = false;
+    bool blNoGet = false;  // it shows no entry by name
     bool blNoRanges = false;
 
     bool operator==(const KnownRouter& other) const = default;
