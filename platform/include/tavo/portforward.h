@@ -43,7 +43,7 @@ void TAVOPFConfFree(TAVO_PF_CONF* pHead);
  * counted round in its own kind), before it writes the new one. Where it was killed in between,
  * the newest such copy is put back before the file is read; copies that later writes made obsolete are deleted
  * once they are ten minutes old. Any other name is a person's own copy, and left alone, but for router.conf.bak,
- * which comes back, or is deleted, like the others. A copy of router.conf
+ * which comes back like the others. A copy of router.conf
  * whose six begin with a digit is what a report set aside: once the report is gone it comes back in the place of what
  * the report put there, unless that was changed by hand more than ten seconds later. Who sets a copy of router.conf
  * aside for longer and wants it back himself has a read lock on it (fcntl, F_OFD_SETLK): it is left to him as long as

@@ -117,16 +117,10 @@ void BringBackReported(const char* szPath, const std::vector<AsideCopy>& rgCopie
     }
 }
 
-// Whether nobody will want the copy back, once the live file is newer.
+// Whether nobody will want the copy back, once the live file is newer. A person may have made one that ends in ".bak":
+// the next settings that are stored delete that.
 bool IsLeft(const AsideCopy& copy, const struct stat& live) {
-    switch (copy.enKind) {
-        case Kind::kReported:
-            return IsNewer(live, copy) && !IsHeld(copy);
-        case Kind::kTried:
-            return !IsHeld(copy);
-        default:
-            return true;
-    }
+    return copy.enKind == Kind::kAside || (copy.enKind == Kind::kReported && IsNewer(live, copy) && !IsHeld(copy));
 }
 
 bool IsThere(const char* szPath) {

@@ -15,8 +15,8 @@ bool BringBack(const char* szPath);
 // write as well: he must not take what a killed writer left for the live file.
 void EndReport(const char* szPath);
 // Deletes copies that a newer file made obsolete: brought back at some later day, they would open ports that nobody
-// asks for any more, and they may hold a password. Those of the last ten minutes stay, and those of a writer that
-// lives.
+// asks for any more, and they may hold a password. Those of the last ten minutes stay, those of a writer that lives,
+// and router.conf.bak.
 void DropObsolete(const char* szPath);
 
 }  // namespace tavo
