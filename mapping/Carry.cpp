@@ -77,7 +77,6 @@ bool Carrier::Remove(Place& place, const char* szWhy) {
     place.szWhyGone = szWhy;
     place.before.reset();
     mPlaces.habit.setLost.erase(place.key);
-    mPlaces.blTable = false;
     RouterReply reply = Note(mPlaces.router.Remove(place.gone));
     const Made* pMade = mPlaces.MadeAt(place);
     const bool blUnseen = mPlaces.what.blForm && !mPlaces.what.blShows;
@@ -328,7 +327,6 @@ bool Carrier::Add(Place& place, bool blAnew) {
     RouterMapping mapping = *place.pWanted;
     mapping.szClient = Box();
     const int64_t nAsked = mPlaces.Now();
-    mPlaces.blTable = false;
     const RouterReply& reply = place.answer = Note(AddWithLease(mPlaces.router, mapping, mPlaces.habit));
     if (Made* pMade = mPlaces.MadeAt(place); reply.IsSilence() && mapping.nLease == 0 && pMade != nullptr) {
         pMade->nLease = 0;  // it may be there by now, without the lease that was asked for at first
@@ -447,7 +445,7 @@ void Carrier::Confirm(Place& place) {
     const bool blAnew = place.verdict.blAnew;
     RouterReply reply;
     if (!mPlaces.IsServed(place) || mPlaces.what.blForm) {
-        reply = IsOver() ? mPlaces.guard.Unasked() : mPlaces.Look(place, true);
+        reply = IsOver() ? mPlaces.guard.Unasked() : mPlaces.Look(place);
     }
     const bool blWritten = std::exchange(place.blWritten, false);
     if (mPlaces.IsServed(place)) {
@@ -569,7 +567,6 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
         const bool blOther = !habit.router.szGateway.empty() && !habit.router.IsSame(record.Router());
         habit.blPermanentOnly = habit.blPermanentOnly && !blOther;
         habit.blLeaseNoMatter = habit.blLeaseNoMatter && !blOther;
-        habit.blNoGet = habit.blNoGet && !blOther;
         habit.blNoRanges = habit.blNoRanges && !blOther;
         habit.mapElsewhere.clear();
         habit.setLost.clear();

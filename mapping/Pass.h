@@ -22,7 +22,6 @@ struct Habits {
     uint32_t nLease = 3600;        // seconds to ask for
     bool blPermanentOnly = false;  // it refuses leases
     bool blLeaseNoMatter = false;  // it took a lease, or refuses without one, too: what it refuses is not the lease
-    bool blNoGet = false;          // it does not show one entry by name: its list has to do
     bool blNoRanges = false;       // it could not show a range, and may have died of the question
     // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
     // are not asked for again while they stand here.

@@ -19,11 +19,6 @@ constexpr int kRangePorts = 64;
 // Asking for a second place would be answered with the first, and giving that back would end it.
 constexpr char kShared[] = "another rule has this port of the box; the router gives it one router port only";
 
-// A listing whose answer did not come: the next one may.
-bool IsLost(const RouterReply& reply) {
-    return reply.IsSilence() && reply.enReply != Reply::kTooLong;
-}
-
 }  // namespace
 
 Places::Places(Router& aRouter, const std::vector<RouterMapping>& rgWanted, Record& record, Habits& aHabit,
@@ -100,31 +95,20 @@ RouterMapping Places::Known(const Place& place) {
     return MappingOf(place.key, *pMade, nLeft);
 }
 
-RouterReply Places::List() {
-    std::vector<RouterMapping> rgTable;
-    RouterReply reply = guard.Note(router.List(rgTable));
-    ++mNTables;
-    blTable = reply.IsOk();
-    nListed = blTable ? rgTable.size() : 0;
-    for (const RouterMapping& entry : rgTable) {
-        Place& place = At(KeyOf(entry));
-        place.nTable = mNTables;
-        Show(entry, place);
-    }
-    return reply;
-}
-
 // What a table does not show may be there: it is read entry by entry, and whatever others take away or make meanwhile
 // moves those that follow.
 void Places::LookAtTable() {
-    if (what.blShows) {
-        mListed = List();
+    std::vector<RouterMapping> rgTable;
+    const RouterReply reply = guard.Note(router.List(rgTable));
+    if (!what.blShows) {
+        result.transport = reply.IsSilence() ? reply : result.transport;
+        Recall();
         return;
     }
-    std::vector<RouterMapping> rgNone;
-    const RouterReply reply = guard.Note(router.List(rgNone));
-    result.transport = reply.IsSilence() ? reply : result.transport;
-    Recall();
+    for (const RouterMapping& entry : rgTable) {
+        Show(entry, At(KeyOf(entry)));
+    }
+    nListed = reply.IsOk() ? rgTable.size() : 0;
 }
 
 // A router that shows nothing: what it has granted, and what has not run out since, is what there is while it answers.
@@ -166,45 +150,15 @@ void Places::Show(const RouterMapping& entry, Place& place) {
     pMade->blShown = true;
 }
 
-RouterReply Places::Look(Place& place, bool blDoubt) {
+RouterReply Places::Look(Place& place) {
     RouterMapping entry;
-    RouterReply reply =
-        habit.blNoGet ? RouterReply{Reply::kRefused} : guard.Note(router.Get(place.key.first, place.key.second, entry));
+    RouterReply reply = guard.Note(router.Get(place.key.first, place.key.second, entry));
     if (reply.IsOk()) {
         Show(entry, place);
-        return reply;
-    }
-    const bool blAbsent = reply.enReply == Reply::kNoSuchEntry;
-    if (reply.IsRefusal() && !blAbsent && IsLost(mListed)) {
-        return mListed;
-    }
-    if (reply.IsRefusal()) {
-        place.enSeen = blAbsent ? Seen::kAbsent : Seen::kHidden;
-    }
-    if (reply.IsRefusal() && (!blAbsent || blDoubt) && what.blShows && !what.blForm && mListed.IsOk()) {
-        const RouterReply listed = LookInTable(place);
-        // One that was only slow to show it shows it by name by now.
-        habit.blNoGet = habit.blNoGet || !blAbsent || (listed.IsOk() && IsDenied(place));
-        return listed;
+    } else if (reply.IsRefusal()) {
+        place.enSeen = reply.enReply == Reply::kNoSuchEntry ? Seen::kAbsent : Seen::kHidden;
     }
     return reply;
-}
-
-bool Places::IsDenied(const Place& place) {
-    RouterMapping entry;
-    return guard.Note(router.Get(place.key.first, place.key.second, entry)).enReply == Reply::kNoSuchEntry;
-}
-
-// Where no entry can be asked for by name, a list is the proof of what is there and what is not.
-RouterReply Places::LookInTable(Place& place) {
-    RouterReply reply = blTable ? RouterReply() : List();
-    if (!reply.IsOk()) {
-        place.enSeen = IsLost(reply) ? Seen::kUnknown : Seen::kHidden;
-        return reply;
-    }
-    const bool blThere = place.nTable == mNTables;
-    place.enSeen = blThere ? Seen::kPresent : Seen::kAbsent;
-    return {blThere ? Reply::kOk : Reply::kNoSuchEntry};
 }
 
 void Places::LookAt(PlaceList& rgpPlaces) {
@@ -247,8 +201,13 @@ bool Places::IsListedWithout(const PlaceList& rgpPlaces) {
     if (nListed < rgpPlaces.size() || nListed - rgpPlaces.size() >= rgpPlaces.size()) {
         return false;
     }
-    const size_t nLeft = nListed - rgpPlaces.size();
-    return List().IsOk() && nListed == nLeft;
+    std::vector<RouterMapping> rgTable;
+    const bool blShown = guard.Note(router.List(rgTable)).IsOk();
+    const bool blWithout = blShown && rgTable.size() == std::exchange(nListed, rgTable.size()) - rgpPlaces.size();
+    for (const RouterMapping& entry : rgTable) {
+        Show(entry, At(KeyOf(entry)));
+    }
+    return blWithout;
 }
 
 // What a range does not show is gone where the router says so of one of the places by name, too: some leave out what

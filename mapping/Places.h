@@ -26,7 +26,6 @@ struct Place {
     RouterReply kept = {};            // the router's word for what it did not take away
     RouterMapping gone = {};          // what was taken away, as it was known
     const char* szWhyGone = "";       // it was taken away
-    size_t nTable = 0;                // the last listing that showed it
     std::optional<Made> before = {};  // our record of it, where the router's yes to that is not all there is to see
     RouterReply answer = {};          // to the last asking for it
     const char* szWhy = "";           // it was asked for
@@ -50,8 +49,7 @@ struct Places {
     RouterMapping Known(const Place& place);
 
     void LookAtTable();
-    // By name; by the list, where it shows nothing by name, or (blDoubt) shows nothing there.
-    RouterReply Look(Place& place, bool blDoubt = false);
+    RouterReply Look(Place& place);
     // Drops those for which there was no time: a slow router's pass is for doing something, too.
     void LookAt(PlaceList& rgpPlaces);
     // What the router shows of the places, where it can show ranges; may be incomplete. fnCovered: is told of each
@@ -79,20 +77,13 @@ struct Places {
     PassGuard guard;
     int64_t nNext = kNever;  // when something has to be done again
     std::map<MappingKey, Place> mapPlaces;
-    size_t nListed = 0;    // entries, where the table was shown to its end
-    bool blTable = false;  // it was, and nothing has been asked for since
+    size_t nListed = 0;  // entries, where the table was shown to its end
 
 private:
     void Show(const RouterMapping& entry, Place& place);
-    RouterReply List();
-    RouterReply LookInTable(Place& place);
-    bool IsDenied(const Place& place);
     bool IsListedWithout(const PlaceList& rgpPlaces);
     void LookForGoneInRanges(const PlaceList& rgpPlaces);
     void Recall();
-
-    size_t mNTables = 0;  // listings
-    RouterReply mListed;  // the answer to the first of them
 };
 
 }  // namespace tavo

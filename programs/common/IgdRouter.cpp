@@ -55,7 +55,13 @@ Abilities IgdRouter::What() const {
 RouterReply IgdRouter::List(std::vector<RouterMapping>& rgMappings) {
     std::vector<IgdEntry> rgEntries;
     const int nCode = mIgd.List(rgEntries);
-    return Take(nCode, std::move(rgEntries), rgMappings);
+    mListed = Take(nCode, std::move(rgEntries), rgMappings);
+    mBlChanged = false;
+    mMapTable.clear();
+    for (const RouterMapping& mapping : rgMappings) {
+        mMapTable.emplace(Place(mapping.szProtocol, mapping.nRouterPort), mapping);
+    }
+    return mListed;
 }
 
 RouterReply IgdRouter::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
@@ -65,23 +71,65 @@ RouterReply IgdRouter::ListRange(const std::string& szProtocol, uint16_t nFirst,
     return Take(nCode, std::move(rgEntries), rgMappings);
 }
 
-RouterReply IgdRouter::Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) {
+RouterReply IgdRouter::GetByName(const Place& place, RouterMapping& mapping) {
     IgdEntry entry;
-    const int nCode = mIgd.Get(szProtocol, nRouterPort, entry);
+    const int nCode = mIgd.Get(place.first, place.second, entry);
     if (nCode == kWireOk) {
         mapping = MappingOf(std::move(entry));
     }
     return IgdReply(nCode);
 }
 
+// A list without an end is not asked for again; one that was refused may only have been empty.
+RouterReply IgdRouter::GetByList(const Place& place, RouterMapping& mapping) {
+    if (mListed.enReply != Reply::kTooLong && (mBlChanged || mListed.IsSilence())) {
+        std::vector<RouterMapping> rgTable;
+        List(rgTable);
+    }
+    if (const auto it = mMapTable.find(place); mListed.IsOk() && it != mMapTable.end()) {
+        mapping = it->second;
+        return {};
+    }
+    if (mListed.IsOk()) {
+        return {Reply::kNoSuchEntry, std::to_string(kIgdNoSuchEntry)};
+    }
+    return mListed.enReply == Reply::kTooLong ? RouterReply{Reply::kRefused, mListed.szWord} : mListed;
+}
+
+RouterReply IgdRouter::Get(const std::string& szProtocol, uint16_t nRouterPort, RouterMapping& mapping) {
+    const Place place(szProtocol, nRouterPort);
+    if (mBlNoGet) {
+        return GetByList(place, mapping);
+    }
+    RouterReply reply = GetByName(place, mapping);
+    const bool blDenied = reply.enReply == Reply::kNoSuchEntry;
+    if (!reply.IsRefusal() || (blDenied && !mSetGranted.contains(place))) {
+        return reply;
+    }
+    RouterReply listed = GetByList(place, mapping);
+    RouterMapping again;  // one that was only slow to show it shows it by name by now
+    mBlNoGet = !blDenied || (listed.IsOk() && GetByName(place, again).enReply == Reply::kNoSuchEntry);
+    return blDenied && listed.IsRefusal() ? reply : listed;
+}
+
 RouterReply IgdRouter::Add(RouterMapping& mapping) {
-    return IgdReply(mIgd.Add({mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort, mapping.szClient,
-                              mapping.szDescription, mapping.nLease, mapping.blEnabled}));
+    mBlChanged = true;
+    RouterReply reply = IgdReply(mIgd.Add({mapping.szProtocol, mapping.nRouterPort, mapping.nBoxPort, mapping.szClient,
+                                           mapping.szDescription, mapping.nLease, mapping.blEnabled}));
+    if (reply.IsOk()) {
+        mSetGranted.emplace(mapping.szProtocol, mapping.nRouterPort);
+    }
+    return reply;
 }
 
 RouterReply IgdRouter::Remove(const RouterMapping& mapping) {
+    mBlChanged = true;
     const bool blOwn = mapping.szClient != mSzBox && IsOwnAddress(mapping.szClient);
-    return IgdReply(mIgd.Remove(mapping.szProtocol, mapping.nRouterPort, blOwn ? mapping.szClient : ""));
+    RouterReply reply = IgdReply(mIgd.Remove(mapping.szProtocol, mapping.nRouterPort, blOwn ? mapping.szClient : ""));
+    if (reply.IsOk()) {
+        mSetGranted.erase({mapping.szProtocol, mapping.nRouterPort});
+    }
+    return reply;
 }
 
 }  // namespace tavo

@@ -33,7 +33,7 @@ void UpnpMapper::NewGateway() {
     KnownRouter known = RecallRouter(Gateway());
     mPlace = std::move(known.place);
     mHabit.blPermanentOnly = known.blPermanentOnly;
-    mHabit.blNoGet = known.blNoGet;
+    mBlNoGet = known.blNoGet;
     mHabit.blNoRanges = known.blNoRanges;
     mSzKnownHardware = std::move(known.szHardware);
 }
@@ -72,7 +72,7 @@ void UpnpMapper::Remember() {
     if (const std::string& szHardware = mMade.Get().Router().szHardware; !szHardware.empty()) {
         mSzKnownHardware = szHardware;
     }
-    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mHabit.blNoGet, mHabit.blNoRanges});
+    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mBlNoGet, mHabit.blNoRanges});
 }
 
 // Another device at the address of the one before has habits of its own.
@@ -80,6 +80,7 @@ void UpnpMapper::TurnTo(const RouterName& router) {
     mMade.Get().TurnTo(router);
     if (!router.IsSame({Gateway(), mSzKnownHardware})) {
         mHabit = {};
+        mBlNoGet = false;
     }
 }
 
@@ -137,7 +138,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
     KeepEvents(rgWanted, fnStop);
-    IgdRouter router(*mPIgd, Box());
+    IgdRouter router(*mPIgd, Box(), mBlNoGet);
     bool blChanged = false;
     Surroundings around = Around(Box(), fnStop, mMade);
     around.mapOthers = Others();
@@ -148,10 +149,11 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
     };
     if (const auto pBefore = std::exchange(mPBefore, nullptr)) {
         SysLog(LOG_NOTICE, "the router's line at %s is used now", mPIgd->Service().control.Text().c_str());
-        IgdRouter before(*pBefore, Box());
+        IgdRouter before(*pBefore, Box(), mBlNoGet);
         BringInLine(before, {}, mMade.Get(), mHabit, around);
     }
     PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);
+    mBlNoGet = router.HasNoGet();
     mQuietUntil = blChanged ? BootClock::now() + kEcho : mQuietUntil;
     result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;
     Remember();

@@ -45,6 +45,7 @@ private:
     std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
     Descriptor mFdLate;             // where nothing was found, what comes later is heard
     Habits mHabit;
+    bool mBlNoGet = false;  // it shows no entry by name
     MadeFile mMade;
     Events mEvents;
     BootClock::time_point mQuietUntil;  // before then, what the router tells of its table is our own doing

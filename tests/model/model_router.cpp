@@ -74,7 +74,6 @@ std::string Habits::Text() const {
         {blSlowToHide, "slow to hide"},
         {blSlowToShow, "slow to show"},
         {blSlow, "slow"},
-        {blNoGet, "nothing by name"},
         {blForm, "form"},
         {blApply, "to be applied"},
         {blMute, "mute"},
@@ -202,9 +201,6 @@ Reply Router::Get(const std::string& szProtocol, uint16_t nRouterPort, tavo::Rou
         return FormGet({szProtocol, nRouterPort}, mapping);
     }
     return Answer([&]() -> Reply {
-        if (habits.blNoGet) {
-            return {tavo::Reply::kRefused, "401"};
-        }
         const auto mapView = View();
         const auto it = mapView.find({szProtocol, nRouterPort});
         if (it == mapView.end()) {

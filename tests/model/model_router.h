@@ -41,7 +41,6 @@ struct Habits {
     bool blKeepsRemoved = false;  // says yes to a removal, and keeps the entry
     bool blSlowToHide = false;    // shows an entry for some seconds after it was taken away
     bool blSlowToShow = false;    // shows a new one only some seconds after it was made
-    bool blNoGet = false;         // shows no entry by name
     bool blSlow = false;          // each answer takes a second
     // The router's own pages: no leases, an entry is never changed in place, the box reads the list once and after each
     // change, and begins anew for each pass, with the record from the disk.

@@ -54,7 +54,6 @@ public:
         habits.blSlowToHide = OneIn(6) && !habits.blBlind;
         habits.blSlowToShow = OneIn(6) && !habits.blBlind;
         habits.blSlow = OneIn(6);
-        habits.blNoGet = habits.enList == tavo::Reply::kOk && !habits.blBlind && OneIn(4);
         if (OneIn(5)) {
             habits = {.blPermanentOnly = true, .nText = OneIn(2) ? 0 : 2, .blForm = true, .blMute = OneIn(3)};
             habits.blHidesClient = !habits.blMute && OneIn(3);
@@ -176,9 +175,8 @@ private:
                 Tell(mBlDiskFull ? "disk full" : "disk has room");
                 break;
             case 13:
-                // Not of one whose list is the only witness.
-                mRouter.nSkipPerMille =
-                    mRouter.nSkipPerMille == 0 && !mRouter.habits.blKeepsRemoved && !mRouter.habits.blNoGet ? 200 : 0;
+                // Of one that lies about a removal, too, a short listing would be the only witness.
+                mRouter.nSkipPerMille = mRouter.nSkipPerMille == 0 && !mRouter.habits.blKeepsRemoved ? 200 : 0;
                 Tell("entries left out of listings: " + std::to_string(mRouter.nSkipPerMille));
                 break;
             case 14:
@@ -386,7 +384,7 @@ private:
     // Nobody else's entry ever changes.
     void CheckStrangers(const std::map<MappingKey, model::Router::Entry>& mapBefore) {
         if (!mRouter.szBroken.empty()) {
-            mSzBroken = mRouter.szBroken + "\n    router: " + mRouter.habits.Text();
+            mSzBroken = mRouter.szBroken;
         }
         for (const auto& [key, before] : mapBefore) {
             const model::Router::Entry* pNow = mRouter.At(key);

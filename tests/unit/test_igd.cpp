@@ -11,6 +11,7 @@
 #include <tuple>
 
 #include "ground/Descriptor.h"
+#include "programs/common/IgdRouter.h"
 #include "tavo/core.h"
 #include "webserver.h"
 #include "wire/upnp/Description.h"
@@ -440,11 +441,11 @@ TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
         size_t nShown;
     };
     const JumpingClock clock;
-    const Case rgCases[] = {{0, 713, 0, 0, 0},   {2, 713, 0, 0, 2},
-                            {0, 714, 0, 0, 0},   {2, 714, 0, 0, 2},
-                            {2, 402, 0, 0, 2},   {0, 402, 0, 402, 0},
-                            {2, 501, 0, 501, 0}, {0, 401, 0, 401, 0},
-                            {7, 713, 1, 0, 7},   {99, 713, 1, tavo::kWireTooLong, 8}};
+    const Case rgCases[] = {{0, 713, 0, 0, 0}, {2, 713, 0, 0, 2},
+                            {0, 714, 0, 0, 0}, {2, 714, 0, 0, 2},
+                            {2, 402, 0, 0, 2}, {0, 402, 0, 402, 0},
+                            {2, 501, 0, 0, 2}, {0, 401, 0, 401, 0},
+                            {7, 713, 1, 0, 7}, {99, 713, 1, tavo::kWireTooLong, 8}};
     for (const Case& one : rgCases) {
         const auto pHttp = std::make_shared<Table>();
         for (int i = 1; i <= one.nEntries; ++i) {
@@ -521,6 +522,65 @@ TEST(Igd, WhatAnEntryAndAnAddressSay) {
     EXPECT_EQ(pIgd->GetAt(0, rgMappings.back()), 606);
     EXPECT_EQ(pIgd->ListRange("TCP", 1, 2, rgMappings), 606);
     EXPECT_EQ(pHttp->mNPosts, 5);
+}
+
+// A router with a list, whose answer about one entry is always the same code; 0: what there is.
+class ByList : public Canned {
+public:
+    tavo::HttpAnswer Post(const tavo::HttpUrl&, const std::vector<std::string>&, const std::string& szBody) override {
+        const auto fnHas = [&](const std::string& szText) { return szBody.find(szText) != std::string::npos; };
+        mSzAsked += fnHas("Generic") ? "l" : fnHas("Specific") ? "g" : "a";
+        if (fnHas("AddPortMapping")) {
+            mNEntries = 1;
+        }
+        const bool blShown = mNEntries != 0 && (fnHas("Index>0<") || (fnHas("Specific") && mNGet == 0));
+        return blShown ? Said(
+                             "<NewExternalPort>1</NewExternalPort><NewProtocol>TCP</NewProtocol><NewInternalPort>5"
+                             "</NewInternalPort><NewInternalClient>192.168.1.5</NewInternalClient>")
+               : fnHas("Generic")  ? Fault(mNList)
+               : fnHas("Specific") ? Fault(mNGet == 0 ? 714 : mNGet)
+                                   : Said("");
+    }
+    int mNGet = 0;
+    int mNList = 713;
+    int mNEntries = 0;
+};
+
+// A list of one entry takes two questions.
+TEST(Igd, WhereNothingIsShownByNameTheListIsTheProof) {
+    struct Case {
+        int nGet;
+        int nList;
+        std::string szAsked;  // looks for what is not there, makes it, and looks twice
+        std::string szSeen;   // and what each look finds
+        bool blNoGet;
+    };
+    const Case rgCases[] = {{0, 713, "gagg", "-11", false},   {401, 713, "glall", "-11", true},
+                            {501, 713, "glall", "-11", true}, {714, 713, "gagllg", "-11", true},
+                            {401, 401, "glall", "?11", true}, {714, 401, "gagllg", "-11", true}};
+    for (const Case& one : rgCases) {
+        const auto pHttp = std::make_shared<ByList>();
+        pHttp->mNGet = one.nGet;
+        pHttp->mNList = one.nList;
+        const auto pIgd = IgdAt(pHttp);
+        tavo::IgdRouter router(*pIgd);
+        std::string szSeen;
+        const auto fnLook = [&] {
+            tavo::RouterMapping seen;
+            const tavo::RouterReply reply = router.Get("TCP", 1, seen);
+            szSeen += reply.IsOk()                                 ? std::to_string(seen.nRouterPort)
+                      : reply.enReply == tavo::Reply::kNoSuchEntry ? "-"
+                                                                   : "?";
+        };
+        fnLook();
+        tavo::RouterMapping mapping{"TCP", 1, 5, "192.168.1.5", "", 0, true};
+        EXPECT_TRUE(router.Add(mapping).IsOk());
+        fnLook();
+        fnLook();
+        EXPECT_EQ(pHttp->mSzAsked, one.szAsked) << one.nGet << " " << one.nList;
+        EXPECT_EQ(szSeen, one.szSeen) << one.nGet << " " << one.nList;
+        EXPECT_EQ(router.HasNoGet(), one.blNoGet);
+    }
 }
 
 // A home network on the loopback device, with a gateway that answers searches.

@@ -195,8 +195,8 @@ TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
     const std::tuple<int, int, int, int, const char*> rgCases[] = {
         {tavo::kWireOk, 0, 0, 1 + 10 + 10 + 1, "1"},
         {tavo::kWireOk, 5, 0, 1 + 10 + 10 + 1 + 1, "1"},
-        {tavo::kWireOk, 0, 5, 1 + 10 + 10 + 1 + 1 + 1, "lost"},  // by the list, too, which shows the others as well
-        {tavo::kIgdInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 5 + 1, "lost"},
+        {tavo::kWireOk, 0, 5, 1 + 10 + 10 + 1 + 1, "lost"},
+        {tavo::kIgdInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 10, "lost"},
         {tavo::kWireTimeout, 0, 0, 1 + 10 + 10 + 1 + 10, "1"}};
     for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] : rgCases) {
         MemoryRouter router;
@@ -713,30 +713,6 @@ TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
     }
 }
 
-// Some know no question for one entry, and some answer it as if there were nothing: the list is the proof.
-TEST(Mapping, WhereNothingIsShownByNameTheListIsTheProof) {
-    for (const int nGet : {401, 402, 501, 602, 606, static_cast<int>(tavo::kIgdNoSuchEntry)}) {
-        SCOPED_TRACE(nGet);
-        MemoryRouter router;
-        Core core;
-        router.mNGetCode = nGet;
-        router.Put(Entry(2, 2, "192.168.1.9", "game"));
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")})),
-                  (Rows{"1/tcp 1 anew", "2/tcp 718 192.168.1.9 game"}));
-        router.mNSwallowed = 3;
-        router.mNCalls = 0;
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(3, 3, "", "tavo:a")})),
-                  (Rows{"1/tcp 1", "3/tcp lost"}));
-        EXPECT_LE(router.mNCalls, 6) << "a list, the mapping, and a list";
-        EXPECT_TRUE(core.habit.blNoGet);
-        router.mBlKeepsRemoved = nGet != tavo::kIgdNoSuchEntry;
-        EXPECT_EQ(core.Run(router, {}).rgOutcomes.size(), router.mBlKeepsRemoved ? 1U : 0U);
-        router.mBlKeepsRemoved = false;
-        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-        EXPECT_EQ(router.mMapTable.size(), 1U);
-    }
-}
-
 TEST(Mapping, WhatAnotherHostTookMeanwhileIsItsOwn) {
     class Robbed : public MemoryRouter {
     public:
@@ -757,9 +733,6 @@ TEST(Mapping, WhatIsShownOnlyAfterAWhileIsOurs) {
     public:
         RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
             return mBlShows ? MemoryRouter::Get(szProtocol, nPort, mapping) : IgdReply(tavo::kIgdNoSuchEntry);
-        }
-        RouterReply List(std::vector<RouterMapping>& rgMappings) override {
-            return mBlShows ? MemoryRouter::List(rgMappings) : RouterReply();
         }
         bool mBlShows = false;
     };

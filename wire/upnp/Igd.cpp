@@ -217,8 +217,8 @@ int Igd::List(std::vector<IgdEntry>& rgMappings) {
         }
         IgdEntry mapping;
         const int nCode = GetAt(i, mapping);
-        // The end of the table; some routers say so with the codes for bad arguments or no entry.
-        if (nCode == kIgdNoSuchIndex || nCode == kIgdNoSuchEntry || (nCode == kIgdInvalidArgs && i > 0)) {
+        // The end of the table, which some routers tell by whatever code they have.
+        if (nCode == kIgdNoSuchIndex || nCode == kIgdNoSuchEntry || (nCode > kWireOk && i > 0)) {
             break;
         }
         if (nCode != kWireOk) {
