@@ -25,6 +25,8 @@ constexpr char kKept[] = "kept";        // it said yes to the removal, and shows
 constexpr int64_t kRenewAgain = 60;     // seconds after a renewal that was refused
 constexpr int64_t kRecordAgain = 60;    // seconds after the record could not be written
 constexpr int64_t kLookForLost = 10;    // seconds until one more look for what was not shown
+constexpr int kMostVain = 3;            // mappings, of which it is not the lease that is refused
+constexpr int kTakenWithout = 2;        // mappings, after which a router is known to take no lease
 constexpr int64_t kCloseAgain = 10;     // seconds until an older place of a port of the box may be closed
 
 class Carrier {
@@ -538,24 +540,23 @@ void Forget(Record& record, Habits& habit, const std::string& szBox, bool blRest
 }
 
 // Routers of the first generation know permanent mappings only; some say so, some call it bad arguments, and some only
-// refuse: those are asked once without a lease.
+// refuse. What is not said is believed of the router when it has happened twice.
 RouterReply AddWithLease(Router& router, RouterMapping& mapping, Habits& habit) {
     const RouterMapping wanted = mapping;
     mapping.nLease = habit.blPermanentOnly ? 0 : habit.nLease;
     const bool blLease = mapping.nLease != 0;
     RouterReply reply = router.Add(mapping);
     const bool blSaysSo = reply.enReply == Reply::kOnlyPermanent;
-    const bool blMayBeLease =
-        reply.enReply == Reply::kBadArguments || (reply.enReply == Reply::kRefused && !habit.blLeaseNoMatter);
+    const bool blMayBeLease = (reply.enReply == Reply::kBadArguments || reply.enReply == Reply::kRefused) &&
+                              !habit.blTakesLease && habit.nVain < kMostVain;
+    habit.blTakesLease = habit.blTakesLease || (blLease && reply.IsOk());
     if (blLease && (blSaysSo || blMayBeLease)) {
         mapping = wanted;
         mapping.nLease = 0;
-        RouterReply without = router.Add(mapping);
-        habit.blPermanentOnly = habit.blPermanentOnly || without.IsOk() || blSaysSo;
-        habit.blLeaseNoMatter = habit.blLeaseNoMatter || without.enReply == Reply::kRefused;
-        reply = std::move(without);
-    } else if (blLease && reply.IsOk()) {
-        habit.blLeaseNoMatter = true;
+        reply = router.Add(mapping);
+        habit.nTakenWithout += reply.IsOk() ? 1 : 0;
+        habit.nVain += reply.IsOk() ? 0 : 1;
+        habit.blPermanentOnly = habit.blPermanentOnly || blSaysSo || habit.nTakenWithout >= kTakenWithout;
     }
     return reply;
 }
@@ -566,12 +567,14 @@ PassResult BringInLine(Router& router, const std::vector<RouterMapping>& rgWante
         // What it can do is true for as long as nothing says that it is another one.
         const bool blOther = !habit.router.szGateway.empty() && !habit.router.IsSame(record.Router());
         habit.blPermanentOnly = habit.blPermanentOnly && !blOther;
-        habit.blLeaseNoMatter = habit.blLeaseNoMatter && !blOther;
+        habit.blTakesLease = habit.blTakesLease && !blOther;
+        habit.nTakenWithout = blOther ? 0 : habit.nTakenWithout;
         habit.blNoRanges = habit.blNoRanges && !blOther;
         habit.mapElsewhere.clear();
         habit.setLost.clear();
         habit.router = record.Router();
     }
+    habit.nVain = 0;
     Places places(router, rgWanted, record, habit, around);
     return Carrier(places).Run(rgWanted);
 }

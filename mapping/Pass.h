@@ -21,7 +21,9 @@ namespace tavo {
 struct Habits {
     uint32_t nLease = 3600;        // seconds to ask for
     bool blPermanentOnly = false;  // it refuses leases
-    bool blLeaseNoMatter = false;  // it took a lease, or refuses without one, too: what it refuses is not the lease
+    bool blTakesLease = false;     // it has taken one: what it refuses is something else
+    int nTakenWithout = 0;         // mappings that it refused with a lease and took without one
+    int nVain = 0;                 // and refused without one, too, in this pass
     bool blNoRanges = false;       // it could not show a range, and may have died of the question
     // Places that it gave another one instead of, each with its word. Each asking opens a wrong port for a moment: they
     // are not asked for again while they stand here.

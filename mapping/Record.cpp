@@ -45,7 +45,7 @@ Record::Record(std::string_view szText, std::string szBoot) : mSzBoot(std::move(
             blThisBoot = mapValues["id"] == mSzBoot;
             continue;
         }
-        Elsewhere row{{mapValues["gateway"], mapValues["hardware"]},
+        Elsewhere row{{mapValues["gateway"], mapValues["hardware"], mapValues["line"]},
                       {mapValues["protocol"], NumberIn<uint16_t>(mapValues["router_port"])},
                       {mapValues["client"], NumberIn<uint16_t>(mapValues["box_port"]), mapValues["text"],
                        mapValues["shown"] == "yes", NumberIn<uint32_t>(mapValues["lease"])}};
@@ -86,6 +86,17 @@ void Record::TurnTo(const RouterName& router) {
     mRgElsewhere = std::move(rgAll);
 }
 
+std::set<std::string> Record::OtherLines() const {
+    std::set<std::string> setLines;
+    for (const Elsewhere& row : mRgElsewhere) {
+        const RouterName here{row.router.szGateway, row.router.szHardware, mRouter.szLine};
+        if (row.router.szLine != mRouter.szLine && here.IsSame(mRouter)) {
+            setLines.insert(row.router.szLine);
+        }
+    }
+    return setLines;
+}
+
 void Record::Prune(int64_t nNow, bool blLeases) {
     std::erase_if(mRgElsewhere, [&](const Elsewhere& row) { return row.made.IsSurelyOver(nNow, blLeases); });
     if (mRgElsewhere.size() > kMostElsewhere) {
@@ -112,9 +123,11 @@ std::string Record::Text() const {
         if (rgSections.empty()) {
             rgSections.push_back({kBootSection, {{"id", mSzBoot}}});
         }
-        rgSections.push_back({router.szGateway + " " + key.first + " " + std::to_string(key.second),
+        rgSections.push_back({router.szGateway + " " + key.first + " " + std::to_string(key.second) +
+                                  (router.szLine.empty() ? "" : " " + router.szLine),
                               {{"gateway", router.szGateway},
                                {"hardware", router.szHardware},
+                               {"line", router.szLine},
                                {"protocol", key.first},
                                {"router_port", std::to_string(key.second)},
                                {"box_port", std::to_string(made.nBoxPort)},

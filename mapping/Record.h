@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <map>
+#include <set>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -27,11 +28,13 @@ inline MappingKey KeyOf(const RouterMapping& mapping) {
 struct RouterName {
     std::string szGateway;
     std::string szHardware;
+    std::string szLine = {};  // which of its lines, each with a table of its own, where it has several
 
     bool operator==(const RouterName& other) const = default;
     bool IsSame(const RouterName& other) const {
-        return szHardware.empty() || other.szHardware.empty() ? szGateway == other.szGateway
-                                                              : szHardware == other.szHardware;
+        const bool blOne = szHardware.empty() || other.szHardware.empty() ? szGateway == other.szGateway
+                                                                          : szHardware == other.szHardware;
+        return blOne && szLine == other.szLine;
     }
 };
 
@@ -102,6 +105,8 @@ public:
     Rows& Here() { return mHere; }
     const Rows& Here() const { return mHere; }
 
+    // The other lines of this router that have rows.
+    std::set<std::string> OtherLines() const;
     // Drops the rows of other routers that have surely run out.
     void Prune(int64_t nNow, bool blLeases = false);
     // Nothing that this router once granted counts any more: all of it is due.
@@ -121,7 +126,7 @@ private:
     };
 
     RouterName NameOf(const Made& made) const {
-        return {mRouter.szGateway, made.szHardware.empty() ? mRouter.szHardware : made.szHardware};
+        return {mRouter.szGateway, made.szHardware.empty() ? mRouter.szHardware : made.szHardware, mRouter.szLine};
     }
 
     std::string mSzBoot;

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <iterator>
 #include <utility>
 
 #include "ground/SysLog.h"
@@ -16,6 +17,7 @@ namespace tavo {
 namespace {
 
 constexpr char kNoIgd[] = "noigd";
+constexpr char kNoLine[] = "noline";  // the line that it was made at is gone
 constexpr int kDiscoveryMilliseconds = 8000;
 constexpr int kOutsideMilliseconds = 2000;
 constexpr auto kEcho = std::chrono::seconds(3);  // until what we have changed has been told to us
@@ -40,17 +42,15 @@ void UpnpMapper::NewGateway() {
 
 void UpnpMapper::LostRouter() {
     mPIgd.reset();
-    mPlace = {};
+    mPlace.szLocation.clear();
 }
 
 // Where does the router's service live. False: there is none that we can use.
 bool UpnpMapper::FindRouter(const std::function<bool()>& fnStop) {
     if (mPIgd == nullptr) {
-        const std::string szBefore = mPlace.szControl;
         mPIgd = Igd::Find(Gateway(), Box(), kDiscoveryMilliseconds, &mPlace, 0, fnStop, &mFdLate);
         if (mPIgd != nullptr) {
             mFdLate.Reset();
-            mPBefore = mPIgd->Beside(szBefore);
             mEvents.TurnTo(mPIgd->Service().events, Box());
         }
     }
@@ -67,6 +67,25 @@ void UpnpMapper::ChooseLine(const std::function<bool()>& fnStop) {
     }
 }
 
+// What stands at lines that are not in use, until the router says that it is gone. What is left there.
+OutcomeList UpnpMapper::ClearOtherLines(const RouterName& router, const Surroundings& around) {
+    OutcomeList rgLeft;
+    for (const std::string& szLine : mMade.Get().OtherLines()) {
+        mMade.Get().TurnTo({router.szGateway, router.szHardware, szLine});
+        PassResult result;
+        if (const auto pIgd = mPIgd->Beside(szLine)) {
+            IgdRouter line(*pIgd, Box(), mBlNoGet);
+            Habits habit{.nLease = WishedLease()};
+            result = BringInLine(line, {}, mMade.Get(), habit, around);
+        } else {
+            result.rgOutcomes = LeftOnRecord(mMade.Get(), {}, {}, {Reply::kUnreachable, kNoLine}, BootSeconds());
+        }
+        std::move(result.rgOutcomes.begin(), result.rgOutcomes.end(), std::back_inserter(rgLeft));
+    }
+    mMade.Get().TurnTo(router);
+    return rgLeft;
+}
+
 // What worked is tried first the next time, also after a restart.
 void UpnpMapper::Remember() {
     if (const std::string& szHardware = mMade.Get().Router().szHardware; !szHardware.empty()) {
@@ -78,7 +97,7 @@ void UpnpMapper::Remember() {
 // Another device at the address of the one before has habits of its own.
 void UpnpMapper::TurnTo(const RouterName& router) {
     mMade.Get().TurnTo(router);
-    if (!router.IsSame({Gateway(), mSzKnownHardware})) {
+    if (!router.IsSame({Gateway(), mSzKnownHardware, router.szLine})) {
         mHabit = {};
         mBlNoGet = false;
     }
@@ -107,7 +126,7 @@ std::vector<int> UpnpMapper::WakeFds() const {
 bool UpnpMapper::OnWake() {
     bool blRouter = RuleMapper::OnWake();
     if (const auto late = TakeLate(mFdLate, Gateway())) {
-        mPlace = {late->Text(), ""};
+        mPlace.szLocation = late->Text();
         blRouter = true;
     }
     return (mEvents.TakeNews() && BootClock::now() >= mQuietUntil) || blRouter;
@@ -133,7 +152,9 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         }
         return result;
     }
-    TurnTo(Front(fnStop));
+    RouterName name = Front(fnStop);
+    name.szLine = mPlace.szLine;
+    TurnTo(name);
     mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);
     mHabit.nLease = WishedLease();
@@ -147,13 +168,10 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         blChanged = true;
         fnLog(mapping, step);
     };
-    if (const auto pBefore = std::exchange(mPBefore, nullptr)) {
-        SysLog(LOG_NOTICE, "the router's line at %s is used now", mPIgd->Service().control.Text().c_str());
-        IgdRouter before(*pBefore, Box(), mBlNoGet);
-        BringInLine(before, {}, mMade.Get(), mHabit, around);
-    }
+    OutcomeList rgLeft = ClearOtherLines(name, around);
     PassResult result = BringInLine(router, rgWanted, mMade.Get(), mHabit, around);
     mBlNoGet = router.HasNoGet();
+    std::move(rgLeft.begin(), rgLeft.end(), std::back_inserter(result.rgOutcomes));
     mQuietUntil = blChanged ? BootClock::now() + kEcho : mQuietUntil;
     result.enRouter = result.transport.IsOk() ? RouterState::kOk : RouterState::kSilent;
     Remember();

@@ -36,14 +36,14 @@ private:
     void Remember();
     void TurnTo(const RouterName& router);
     void ChooseLine(const std::function<bool()>& fnStop);
+    OutcomeList ClearOtherLines(const RouterName& router, const Surroundings& around);
     void KeepEvents(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     IgdPlace mPlace;
     std::string mSzKnownHardware;  // of the router whose habits are known
     std::unique_ptr<Igd> mPIgd;
-    std::unique_ptr<Igd> mPBefore;  // the line that was in use before, whose mappings are to be taken away
-    Descriptor mFdLate;             // where nothing was found, what comes later is heard
+    Descriptor mFdLate;  // where nothing was found, what comes later is heard
     Habits mHabit;
     bool mBlNoGet = false;  // it shows no entry by name
     MadeFile mMade;

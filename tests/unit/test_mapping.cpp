@@ -1180,7 +1180,7 @@ TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
          {std::tuple(false, std::vector{Reply::kOk}, Leases{3600}, false),
           {false, {Reply::kOnlyPermanent, Reply::kOk}, {3600, 0}, true},
           {false, {Reply::kOnlyPermanent, Reply::kTimeout}, {3600, 0}, true},
-          {false, {Reply::kBadArguments, Reply::kOk}, {3600, 0}, true},
+          {false, {Reply::kBadArguments, Reply::kOk}, {3600, 0}, false},  // once is not enough
           {false, {Reply::kBadArguments, Reply::kBadArguments}, {3600, 0}, false},
           {false, {Reply::kConflict}, {3600}, false},
           {true, {Reply::kBadArguments}, {0}, true}}) {
@@ -1430,23 +1430,41 @@ TEST(Record, OfEveryPortIsReadBack) {
     std::remove(kFile);
 }
 
-// Some do not say what they refuse. One question more tells, once a router.
+// Some do not say what they refuse: what is taken without a lease, twice, tells; one port that is refused in any case
+// does not, nor a refusal by itself.
 TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
     class Mute : public MemoryRouter {
     public:
         RouterReply Add(RouterMapping& mapping) override {
             ++nAdds;
-            return blAll || mapping.nLease != 0 ? IgdReply(501) : MemoryRouter::Add(mapping);
+            const bool blRefused = mapping.nRouterPort <= nRefused || (mapping.nLease != 0 && nAdds <= nNoLease);
+            return blRefused ? IgdReply(501) : MemoryRouter::Add(mapping);
         }
-        bool blAll = false;
+        int nRefused = 0;  // ports, whatever is asked
+        int nNoLease = 0;  // askings with a lease, of the first ones
         int nAdds = 0;
     };
-    for (const bool blAll : {false, true}) {
+    struct Case {
+        int nRefused;
+        int nNoLease;
+        Rows rgszEnd;
+        int nAdds;
+        bool blPermanent;
+    };
+    const Rows all = {"1/tcp 1 anew", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"};
+    const Case rgCases[] = {{0, 99, all, 2 + 2 + 1 + 1, true},
+                            {0, 1, all, 2 + 1 + 1 + 1, false},
+                            {1, 99, {"1/tcp 501", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"}, 2 + 2 + 2 + 1, true},
+                            {1, 0, {"1/tcp 501", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"}, 2 + 1 + 1 + 1, false},
+                            {4, 99, {"1/tcp 501", "2/tcp 501", "3/tcp 501", "4/tcp 501"}, 2 + 2 + 2 + 1, false}};
+    for (const Case& one : rgCases) {
         Mute router;
-        router.blAll = blAll;
-        EXPECT_EQ(Texts(Core().Run(router, Wanted(2))),
-                  blAll ? (Rows{"1/tcp 501", "2/tcp 501"}) : (Rows{"1/tcp 1 anew", "2/tcp 1 anew"}));
-        EXPECT_EQ(router.nAdds, 3);
+        router.nRefused = one.nRefused;
+        router.nNoLease = one.nNoLease;
+        Core core;
+        EXPECT_EQ(Texts(core.Run(router, Wanted(4))), one.rgszEnd) << &one - rgCases;
+        EXPECT_EQ(router.nAdds, one.nAdds) << &one - rgCases;
+        EXPECT_EQ(core.habit.blPermanentOnly, one.blPermanent) << &one - rgCases;
     }
 }
 

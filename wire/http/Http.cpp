@@ -165,6 +165,8 @@ void HttpClient::Prepare(const HttpUrl& url) {
     curl_easy_setopt(pCurl, CURLOPT_PROXY, "");
     if (!mPImpl->szSource.empty()) {
         curl_easy_setopt(pCurl, CURLOPT_INTERFACE, mPImpl->szSource.c_str());
+        curl_easy_setopt(pCurl, CURLOPT_FRESH_CONNECT, 1L);
+        curl_easy_setopt(pCurl, CURLOPT_FORBID_REUSE, 1L);  // by a request that may go out from anywhere
     }
     curl_easy_setopt(pCurl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(pCurl, CURLOPT_FOLLOWLOCATION, 0L);

@@ -113,11 +113,13 @@ std::vector<IgdService> ParseDescription(const std::string& szXml, const HttpUrl
             return ResolveAddress(element.Child(szName).Text(), szBase, location);
         };
         const auto control = fnResolve("controlURL");
-        const bool blKnown = std::any_of(rgServices.begin(), rgServices.end(), [&](const IgdService& service) {
-            return control && service.control.Text() == control->Text();
-        });
-        if (control && !blKnown && rgServices.size() < kMostServices) {
-            rgServices.push_back({element.Child("serviceType").Text(), *control, fnResolve("eventSubURL"), model});
+        if (!control || rgServices.size() >= kMostServices) {
+            continue;
+        }
+        const IgdService service{element.Child("serviceType").Text(), *control, fnResolve("eventSubURL"), model};
+        if (std::none_of(rgServices.begin(), rgServices.end(),
+                         [&](const IgdService& other) { return other.Name() == service.Name(); })) {
+            rgServices.push_back(service);
         }
     }
     szWhy = !rgServices.empty()  ? ""

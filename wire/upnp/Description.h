@@ -25,6 +25,9 @@ struct IgdService {
     HttpUrl control;
     std::optional<HttpUrl> events;  // where it takes subscriptions; nothing where it tells nothing
     IgdModel model;
+
+    // What tells it from the others of its description, also after the router has begun anew at another port.
+    std::string Name() const { return control.szPath + " " + szType; }
 };
 // Those of a description, in its order, each place once, and the first few: a router has a service for each line, of
 // which one may be dead. None when it is unreadable or has none; szWhy says which.

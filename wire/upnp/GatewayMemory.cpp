@@ -28,7 +28,7 @@ std::string StateOf(const std::string& szGateway, const char* szKey) {
 
 KnownRouter RecallRouter(const std::string& szGateway) {
     const auto fnValue = [&](const char* szKey) { return StateOf(szGateway, szKey); };
-    return {{fnValue("location"), fnValue("service")},
+    return {{fnValue("location"), fnValue("line")},
             fnValue("hardware"),
             fnValue("permanent") == "yes",
             fnValue("names") == "no",
@@ -42,7 +42,7 @@ void KeepRouter(const std::string& szGateway, const KnownRouter& router) {
     MakeDirectory(kStateDir);
     const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(6), &TLIBCSzHashFree);
     TLIBCSzHashSetValue(pHash.get(), "location", router.place.szLocation.c_str());
-    TLIBCSzHashSetValue(pHash.get(), "service", router.place.szControl.c_str());
+    TLIBCSzHashSetValue(pHash.get(), "line", router.place.szLine.c_str());
     TLIBCSzHashSetValue(pHash.get(), "hardware", router.szHardware.c_str());
     TLIBCSzHashSetValue(pHash.get(), "permanent", router.blPermanentOnly ? "yes" : "no");
     TLIBCSzHashSetValue(pHash.get(), "names", router.blNoGet ? "no" : "yes");

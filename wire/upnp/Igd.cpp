@@ -29,7 +29,8 @@ bool IsAddress(const std::string& szText) {
     return inet_pton(AF_INET, szText.c_str(), &address) == 1;
 }
 
-// The address of a host as a router writes it, some with zeros before each number; empty where it is none, as a name.
+// The address of a host as a router writes it, some with zeros before each number; empty where it is none: a name may
+// be anybody's.
 std::string AddressIn(const std::string& szText) {
     std::string szAddress;
     for (const char c : szText) {
@@ -45,10 +46,10 @@ std::string AddressIn(const std::string& szText) {
 // What an entry's answer says beyond its key.
 bool ReadEntry(const XmlElement& root, IgdEntry& mapping) {
     const auto nBoxPort = ParseNumber<uint16_t>(root.Find("NewInternalPort").Text());
-    if (!nBoxPort) {
+    mapping.szClient = AddressIn(root.Find("NewInternalClient").Text());
+    if (!nBoxPort || mapping.szClient.empty()) {
         return false;
     }
-    mapping.szClient = AddressIn(root.Find("NewInternalClient").Text());
     mapping.nBoxPort = *nBoxPort;
     mapping.szDescription = root.Find("NewPortMappingDescription").Text();
     mapping.nLease = ParseNumber<uint32_t>(root.Find("NewLeaseDuration").Text()).value_or(0);
@@ -105,7 +106,7 @@ std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransp
         std::copy_if(rgServices.begin(), rgServices.end(), std::back_inserter(pIgd->mRgBeside),
                      [&](const IgdService& service) { return &service != &rgServices[i]; });
         const int nRank = pIgd->IsOneOfSeveral() ? pIgd->Rank(szKnown) : kBestRank;
-        if (nRank > nBest) {
+        if (nRank > nBest || (nRank == nBest && pIgd->Service().Name() == szKnown)) {
             nBest = nRank;
             pBest = std::move(pIgd);
         }
@@ -113,9 +114,9 @@ std::unique_ptr<Igd> Igd::At(const HttpUrl& location, std::shared_ptr<HttpTransp
     return pBest;
 }
 
-std::unique_ptr<Igd> Igd::Beside(const std::string& szControl) const {
+std::unique_ptr<Igd> Igd::Beside(const std::string& szLine) const {
     const auto it = std::find_if(mRgBeside.begin(), mRgBeside.end(),
-                                 [&](const IgdService& service) { return service.control.Text() == szControl; });
+                                 [&](const IgdService& service) { return service.Name() == szLine; });
     return it == mRgBeside.end() ? nullptr : std::unique_ptr<Igd>(new Igd(*it, mPHttp));
 }
 
@@ -133,12 +134,12 @@ std::unique_ptr<Igd> Igd::Find(const std::string& szGateway, const std::string& 
         pHttp->SetStop(fnStop);
         pHttp->SetLimit(nLimit);
         std::string szWhy;
-        pFound = At(location, pHttp, szWhy, pPlace == nullptr ? "" : pPlace->szControl);
+        pFound = At(location, pHttp, szWhy, pPlace == nullptr ? "" : pPlace->szLine);
         pHttp->SetLimit(kRequestMilliseconds);
         if (pFound == nullptr) {
             SysLog(LOG_WARNING, "router's description at %s is of no use: %s", location.Text().c_str(), szWhy.c_str());
         } else if (pPlace != nullptr) {
-            *pPlace = {location.Text(), pFound->IsOneOfSeveral() ? pFound->Service().control.Text() : ""};
+            *pPlace = {location.Text(), pFound->IsOneOfSeveral() ? pFound->Service().Name() : ""};
         }
         return pFound != nullptr;
     };
@@ -181,7 +182,7 @@ std::optional<bool> Igd::IsConnected() {
 // what is open.
 int Igd::Rank(const std::string& szKnown) {
     const std::optional<bool> blConnected = IsConnected();
-    if (blConnected == true && mService.control.Text() == szKnown) {
+    if (blConnected == true && mService.Name() == szKnown) {
         return kBestRank;
     }
     std::string szAddress;

@@ -23,7 +23,7 @@ struct IgdEntry {
     std::string szProtocol;  // "TCP" or "UDP"
     uint16_t nRouterPort = 0;
     uint16_t nBoxPort = 0;
-    std::string szClient;       // dotted address of the host behind the port; empty: the router does not say
+    std::string szClient;       // dotted address of the host behind the port
     std::string szDescription;  // printable, bounded
     uint32_t nLease = 0;        // seconds; 0: until the router restarts
     bool blEnabled = false;
@@ -43,7 +43,7 @@ enum IgdCode : int {
 // Where a gateway's service was found; empty texts: nowhere yet.
 struct IgdPlace {
     std::string szLocation;  // of the description
-    std::string szControl;   // of the service, where the description has several
+    std::string szLine;      // the service's name, where the description has several
 
     bool operator==(const IgdPlace& other) const = default;
 };
@@ -61,7 +61,7 @@ public:
                                      Descriptor* pFdLate = nullptr);
     // The IGD whose description is at a location; null when there is none, and szWhy says what there is. Of several
     // services the one that is connected, with a public address before any other and with one before none; szKnown,
-    // the control address of one of them, is that one for as long as it is connected.
+    // the name of one of them, is that one for as long as no other is better and it is connected.
     static std::unique_ptr<Igd> At(const HttpUrl& location, std::shared_ptr<HttpTransport> pHttp, std::string& szWhy,
                                    const std::string& szKnown = "");
 
@@ -87,8 +87,8 @@ public:
     const IgdService& Service() const { return mService; }
     // The description has others beside it.
     bool IsOneOfSeveral() const { return !mRgBeside.empty(); }
-    // That of them which is controlled at an address; null: none is.
-    std::unique_ptr<Igd> Beside(const std::string& szControl) const;
+    // That of them which has the name; null: none has.
+    std::unique_ptr<Igd> Beside(const std::string& szLine) const;
 
 private:
     Igd(IgdService service, std::shared_ptr<HttpTransport> pHttp)

@@ -13,6 +13,7 @@
 #include <set>
 #include <span>
 #include <utility>
+#include <vector>
 
 #include "ground/Descriptor.h"
 #include "ground/SysLog.h"
@@ -28,6 +29,8 @@ constexpr uint16_t kSsdpPort = 1900;
 constexpr char kGroup[] = "239.255.255.250";
 constexpr size_t kMaxAnswer = 4096;
 constexpr size_t kMaxReason = 200;
+constexpr size_t kMostOthers = 2;  // places that others than the gateway name
+constexpr size_t kMostUrl = 1000;
 constexpr size_t kMaxLocations = 16;  // a gateway that names more is playing games
 constexpr int kMaxRefusalsLogged = 8;
 constexpr int kStopPollMilliseconds = 250;
@@ -147,7 +150,8 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
         }
         const std::string szUrl(Trim(szLine.substr(kHeader.size())));
         std::optional<HttpUrl> url = ParseHttpUrl(szUrl);
-        if (url && (blGateway || url->szHost == szGateway) && IsAddressForDevices(szGateway)) {
+        if (url && szUrl.size() <= kMostUrl && (blGateway || url->szHost == szGateway) &&
+            IsAddressForDevices(szGateway)) {
             url->szHost = szGateway;
             return url;
         }
@@ -170,6 +174,7 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
     const Clock::time_point limit = start + std::chrono::milliseconds(nLimitMilliseconds);
     Clock::time_point end = std::min<Clock::time_point>(limit, start + kNoWord);
     std::set<std::string> setSeen;
+    std::vector<HttpUrl> rgOthers;
     size_t nAsked = 0;
     int nRefused = 0;
     bool blFound = false;
@@ -195,11 +200,17 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
             continue;
         }
         const Heard heard = Receive(rgWaiting[0].revents != 0 ? fd.Get() : fdKnown.Get(), szGateway, nRefused);
-        blFound = heard.location && setSeen.insert(heard.location->Text()).second && fnTry(*heard.location);
-        if (heard.blGateway || heard.location) {
+        if (heard.blGateway) {
             blSpoke = true;
             end = std::min(limit, std::max(end, Clock::now() + kSilence));
+            blFound = heard.location && setSeen.insert(heard.location->Text()).second && fnTry(*heard.location);
+        } else if (heard.location && rgOthers.size() < kMostOthers) {
+            rgOthers.push_back(*heard.location);
         }
+    }
+    // A router may answer from another address of its own; anybody else may say so, too.
+    for (size_t i = 0; !blSpoke && !blFound && i < rgOthers.size() && !(fnStop && fnStop()); ++i) {
+        blFound = fnTry(rgOthers[i]);
     }
     if (!blFound && pFdLate != nullptr) {
         *pFdLate = std::move(fd);
@@ -211,7 +222,7 @@ std::optional<HttpUrl> TakeLate(const Descriptor& fdLate, const std::string& szG
     int nRefused = kMaxRefusalsLogged;
     for (int i = 0; i < kLateAtOnce; ++i) {
         const Heard heard = Receive(fdLate.Get(), szGateway, nRefused);
-        if (heard.location || !heard.blAnything) {
+        if ((heard.location && heard.blGateway) || !heard.blAnything) {
             return heard.location;
         }
     }

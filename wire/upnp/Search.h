@@ -21,14 +21,15 @@ std::optional<HttpUrl> LocationOf(std::string_view szAnswer, const std::string& 
 // Asks by unicast and by multicast at once, first for what most routers answer to, then for the rest, and hands every
 // new location to fnTry until it answers true. False when none did within nLimitMilliseconds, before that when the
 // gateway has been silent for three seconds after its last word, and when it has said nothing at all within two and a
-// half: a box without a UPnP router is not made to wait. Then pFdLate, where it is given, still hears what comes late.
-// Asks from the local port nLocalPort, from any other when that one is taken or 0. Ends soon after fnStop, where there
-// is one, answers true.
+// half: a box without a UPnP router is not made to wait. What others than the gateway say is tried, two places of it,
+// only where the gateway itself has said nothing. Then pFdLate, where it is given, still hears what comes late. Asks
+// from the local port nLocalPort, from any other when that one is taken or 0. Ends soon after fnStop, where there is
+// one, answers true.
 bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int nLimitMilliseconds, int nLocalPort,
                    const std::function<bool(const HttpUrl&)>& fnTry, const std::function<bool()>& fnStop,
                    Descriptor* pFdLate = nullptr);
 
-// The next place that came late, where one did; never waits.
+// The next place that came late from the gateway itself, where one did; never waits.
 std::optional<HttpUrl> TakeLate(const Descriptor& fdLate, const std::string& szGateway);
 
 }  // namespace tavo

@@ -1,6 +1,8 @@
 // See Soap.h.
 #include "wire/upnp/Soap.h"
 
+#include <string_view>
+
 namespace tavo {
 
 namespace {
@@ -20,6 +22,14 @@ std::string Envelope(const std::string& szService, const char* szAction, const s
     return szXml + "</u:" + szAction + "></s:Body></s:Envelope>";
 }
 
+// A value may be cut where the answer is: its body has to be closed.
+bool IsWhole(std::string_view szText) {
+    const size_t nName = szText.rfind("Body");
+    const size_t nTag = nName == std::string_view::npos ? nName : szText.rfind('<', nName);
+    return nTag != std::string_view::npos && szText.substr(nTag, 2) == "</" &&
+           szText.find('>', nName) != std::string_view::npos;
+}
+
 int CodeOfBody(long nHttpCode, const XmlElement& root) {
     if (!root.Find("Fault")) {
         return nHttpCode == 200 && root.Find("Body").Child() ? kWireOk : kWireGarbage;
@@ -31,7 +41,7 @@ int CodeOfBody(long nHttpCode, const XmlElement& root) {
 int CodeOf(const HttpAnswer& answer, const XmlElement& root) {
     switch (answer.enEnd) {
         case HttpEnd::kAnswered:
-            return CodeOfBody(answer.nCode, root);
+            return IsWhole(answer.szBody) ? CodeOfBody(answer.nCode, root) : int{kWireGarbage};
         case HttpEnd::kTimeout:
             return kWireTimeout;
         case HttpEnd::kUnreachable:

@@ -5,6 +5,10 @@
 #include <libxml/tree.h>
 #include <libxml/xmlstring.h>
 
+#include <algorithm>
+#include <cctype>
+#include <iterator>
+
 #include "ground/TextFile.h"
 
 namespace tavo {
@@ -12,7 +16,8 @@ namespace tavo {
 namespace {
 
 constexpr size_t kMaxText = 256;
-constexpr size_t kMostBetweenTags = 65536;
+constexpr size_t kMostTag = 16384;  // bytes
+constexpr size_t kMostHead = 200;
 constexpr int kOptions = XML_PARSE_RECOVER | XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING;
 
 const char* Characters(const xmlChar* szText) {
@@ -26,39 +31,79 @@ const _xmlNode* FirstElement(const _xmlNode* pNode) {
     return pNode;
 }
 
-// The parser's time for a tag is the square of its attributes; whatever else is so long is nothing of a router's.
-bool HasEndlessTag(std::string_view szText) {
-    size_t nAt = 0;
-    while (szText.size() - nAt > kMostBetweenTags) {
-        const size_t nNext = szText.find('<', nAt);
-        if (nNext == std::string_view::npos || nNext - nAt > kMostBetweenTags) {
-            return true;
+// The end of a tag, past the ">" that is in no value.
+size_t EndOfTag(std::string_view szText, size_t nAt) {
+    char cQuote = '\0';
+    for (; nAt < szText.size(); ++nAt) {
+        const char c = szText[nAt];
+        if (cQuote != '\0') {
+            cQuote = c == cQuote ? '\0' : cQuote;
+        } else if (c == '>') {
+            return nAt + 1;
+        } else if (c == '"' || c == '\'') {
+            cQuote = c;
         }
-        nAt = nNext + 1;
     }
-    return false;
+    return szText.size();
 }
 
-// What is not the UTF-8 that it passes for is the Latin-1 that it mostly was; so is what nobody knows.
-_xmlDoc* Parse(const std::string& szText) {
-    if (HasEndlessTag(szText)) {
+// Without what costs the parser the square of its length and a router has no need of: declarations, comments, tags of
+// thousands of attributes. Nothing: it cannot be had without.
+std::optional<std::string> Plain(const std::string& szAll) {
+    const std::string_view szText = szAll;
+    std::string szPlain;
+    for (size_t nAt = 0; nAt < szText.size();) {
+        const size_t nTag = std::min(szText.find('<', nAt), szText.size());
+        szPlain += szText.substr(nAt, nTag - nAt);
+        const std::string_view szRest = szText.substr(nTag);
+        const bool blData = szRest.starts_with("<![CDATA[");
+        const bool blComment = szRest.starts_with("<!--");
+        const char* szEnd = blData ? "]]>" : blComment ? "-->" : nullptr;
+        size_t nEnd = szEnd == nullptr ? EndOfTag(szText, nTag) : szText.find(szEnd, nTag);
+        if (nEnd == std::string_view::npos) {
+            nEnd = szText.size();  // cut
+        } else {
+            nEnd += szEnd == nullptr ? 0 : 3;
+        }
+        const std::string_view szTag = szText.substr(nTag, nEnd - nTag);
+        const bool blDeclaration = szTag.starts_with("<!") && !blData && !blComment;
+        if ((blDeclaration && szTag.find('[') != std::string_view::npos) ||
+            (!blData && !blComment && szTag.size() > kMostTag)) {
+            return std::nullopt;
+        }
+        if (!blDeclaration && !blComment) {
+            szPlain += szTag;
+        }
+        nAt = nEnd;
+    }
+    return szPlain;
+}
+
+// Whether it says that it is in an encoding that routers really use; anything else is the UTF-8 or the Latin-1 that it
+// mostly is, whatever it says.
+bool SaysEncoding(std::string_view szText) {
+    std::string szHead(szText.substr(0, std::min(szText.find("?>"), kMostHead)));
+    std::transform(szHead.begin(), szHead.end(), szHead.begin(), [](unsigned char c) { return std::tolower(c); });
+    const size_t nAt = szHead.find("encoding");
+    constexpr std::string_view kKnown[] = {"iso-8859-", "windows-125", "gb", "big5", "shift_jis", "euc-"};
+    return nAt != std::string::npos && std::any_of(std::begin(kKnown), std::end(kKnown), [&](std::string_view szKnown) {
+               return szHead.find(szKnown, nAt) != std::string::npos;
+           });
+}
+
+_xmlDoc* Parse(const std::string& szAll) {
+    const std::optional<std::string> szText = Plain(szAll);
+    if (!szText) {
         return nullptr;
     }
     const auto fnRead = [&](const char* szEncoding, int nMore) {
-        return xmlReadMemory(szText.data(), static_cast<int>(szText.size()), nullptr, szEncoding, kOptions | nMore);
+        return xmlReadMemory(szText->data(), static_cast<int>(szText->size()), nullptr, szEncoding, kOptions | nMore);
     };
-    const std::string_view szHead = std::string_view(szText).substr(0, szText.find("?>"));
-    const bool blSays = szHead.starts_with("<?xml") && szHead.find("encoding") != std::string_view::npos &&
-                        szHead.find("utf-8") == std::string_view::npos &&
-                        szHead.find("UTF-8") == std::string_view::npos;
-    if (blSays || xmlCheckUTF8(reinterpret_cast<const xmlChar*>(szText.c_str())) == 1) {
-        _xmlDoc* pDocument = fnRead(nullptr, 0);
-        if (!blSays || (pDocument != nullptr && xmlDocGetRootElement(pDocument) != nullptr)) {
-            return pDocument;
-        }
-        xmlFreeDoc(pDocument);
+    if (SaysEncoding(*szText)) {
+        return fnRead(nullptr, 0);
     }
-    return fnRead("ISO-8859-1", XML_PARSE_IGNORE_ENC);
+    const bool blUtf8 = xmlCheckUTF8(reinterpret_cast<const xmlChar*>(szText->c_str())) == 1;
+    return fnRead(blUtf8 ? "UTF-8" : "ISO-8859-1", XML_PARSE_IGNORE_ENC);
 }
 
 }  // namespace
