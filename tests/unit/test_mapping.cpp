@@ -5,9 +5,11 @@
 #include <algorithm>
 #include <cstdio>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <map>
 #include <optional>
+#include <regex>
 #include <set>
 #include <tuple>
 
@@ -28,9 +30,54 @@ using tavo::IgdReply;
 using tavo::RouterMapping;
 using tavo::RouterReply;
 
+constexpr char kNet[] = "192.168.1.";
+constexpr char kBox[] = "192.168.1.5";
+
+RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, const char* szText) {
+    return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
+}
+
+// Mappings as one text: the port on the router, and where they differ "+more" (which has no lease), ">port of the
+// box", "@host" and "=text".
+std::vector<RouterMapping> Parse(const std::string& szMappings, const std::string& szClient = "") {
+    static const std::regex kMapping(R"((\d+)(?:\+(\d+))?(?:>(\d+))?(?:@(\d+))?(?:=(\S+))?)");
+    std::vector<RouterMapping> rgMappings;
+    for (auto it = std::sregex_iterator(szMappings.begin(), szMappings.end(), kMapping); it != std::sregex_iterator();
+         ++it) {
+        const auto nOr = [&it](size_t nGroup, const std::string& szElse) {
+            return static_cast<uint16_t>(std::stoi((*it)[nGroup].matched ? it->str(nGroup) : szElse));
+        };
+        RouterMapping mapping = Entry(nOr(1, ""), nOr(3, it->str(1)), szClient.c_str(), ("tavo:" + it->str(1)).c_str());
+        mapping.nMore = nOr(2, "0");
+        mapping.nLease = (*it)[2].matched ? 0 : mapping.nLease;
+        mapping.szClient = (*it)[4].matched ? kNet + it->str(4) : szClient;
+        mapping.szDescription = (*it)[5].matched ? it->str(5) : mapping.szDescription;
+        rgMappings.push_back(mapping);
+    }
+    return rgMappings;
+}
+
+// And back, without the texts, from a router's table or from the record; the host is named where it is not the box.
+template <typename Map>
+std::string PlacesIn(const Map& mapEntries) {
+    std::string szPlaces;
+    for (const auto& [key, entry] : mapEntries) {
+        szPlaces += (szPlaces.empty() ? "" : " ") + std::to_string(key.second) +
+                    (entry.nMore == 0 ? "" : "+" + std::to_string(entry.nMore)) +
+                    (entry.nBoxPort == key.second ? "" : ">" + std::to_string(entry.nBoxPort)) +
+                    (entry.szClient == kBox ? "" : "@" + entry.szClient.substr(entry.szClient.rfind('.') + 1));
+    }
+    return szPlaces;
+}
+
 // A table in memory that answers as a UPnP router does. One that says no shows nothing.
 class MemoryRouter : public tavo::Router {
 public:
+    explicit MemoryRouter(const std::string& szThere = "") {
+        for (const RouterMapping& mapping : Parse(szThere, kBox)) {
+            Put(mapping);
+        }
+    }
     tavo::Abilities What() const override { return {true, false, false, "718"}; }
     RouterReply List(std::vector<RouterMapping>& rgMappings) override {
         ++mNCalls;
@@ -41,9 +88,10 @@ public:
         }
         return IgdReply(mNListCode);
     }
-    RouterReply ListRange(const std::string&, uint16_t nFirst, uint16_t nLast,
+    RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
                           std::vector<RouterMapping>& rgMappings) override {
         ++mNCalls;
+        mRgszRanges.push_back(szProtocol + " " + std::to_string(nFirst) + "-" + std::to_string(nLast));
         for (const auto& [key, mapping] : mMapTable) {
             if (mNRangeCode == tavo::kWireOk && key.second >= nFirst && key.second <= nLast && mNHidden >= 0 &&
                 key.second != mNHidden) {
@@ -54,6 +102,9 @@ public:
     }
     RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
         ++mNCalls;
+        if (const auto reply = mFnGet ? mFnGet(nPort) : std::nullopt) {
+            return *reply;
+        }
         const auto it = mMapTable.find({szProtocol, nPort});
         if (mNGetCode != tavo::kWireOk || it == mMapTable.end()) {
             return IgdReply(mNGetCode != tavo::kWireOk ? mNGetCode : int{tavo::kIgdNoSuchEntry});
@@ -63,6 +114,9 @@ public:
     }
     RouterReply Add(RouterMapping& mapping) override {
         ++mNCalls;
+        if (const auto reply = mFnAdd ? mFnAdd(mapping) : std::nullopt) {
+            return *reply;
+        }
         if (mapping.nRouterPort == mNSwallowed || mNAddCode != tavo::kWireOk) {
             return IgdReply(mNAddCode);
         }
@@ -81,7 +135,9 @@ public:
 
     RouterMapping& Put(const RouterMapping& mapping) { return mMapTable[tavo::KeyOf(mapping)] = mapping; }
 
-    std::map<std::pair<std::string, uint16_t>, RouterMapping> mMapTable;
+    std::map<tavo::MappingKey, RouterMapping> mMapTable;
+    std::function<std::optional<RouterReply>(RouterMapping&)> mFnAdd;  // these answer in the table's place, if they do
+    std::function<std::optional<RouterReply>(uint16_t)> mFnGet;
     int mNListCode = tavo::kWireOk;
     bool mBlListNothing = false;  // with mNListCode
     int mNGetCode = tavo::kWireOk;
@@ -93,40 +149,45 @@ public:
     int mNHidden = 0;              // not shown in a range; -1: none is
     int mNSwallowed = 0;           // promised and not kept
     int mNCalls = 0;
+    std::vector<std::string> mRgszRanges;
 };
 
-constexpr char kBox[] = "192.168.1.5";
-
-RouterMapping Entry(uint16_t nPort, uint16_t nBoxPort, const char* szClient, const char* szText) {
-    return {"TCP", nPort, nBoxPort, szClient, szText, 100, true};
-}
-
-using Rows = std::vector<std::string>;
-
 // Each outcome in one text: its name, its word, whose doing it is, and what else is known of it.
-std::vector<std::string> Texts(const tavo::PassResult& result) {
-    std::vector<std::string> rgTexts;
+std::string Told(const tavo::PassResult& result) {
+    std::string szTold;
     for (const tavo::Outcome& outcome : result.rgOutcomes) {
         const tavo::Verdict& verdict = outcome.verdict;
-        rgTexts.push_back(
-            outcome.szName + " " + verdict.szWord +
-            (verdict.holder ? " " + verdict.holder->szAddress + " " + verdict.holder->szDescription : "") +
-            (WhyOf(verdict).starts_with("another program of this box") ? " others" : "") +
-            (verdict.blAnew ? " anew" : "") + (outcome.blLeftOver ? " left over" : ""));
+        szTold += (szTold.empty() ? "" : ", ") + outcome.szName + " " + verdict.szWord +
+                  (verdict.holder ? " " + verdict.holder->szAddress + " " + verdict.holder->szDescription : "") +
+                  (WhyOf(verdict).starts_with("another program of this box") ? " others" : "") +
+                  (verdict.blAnew ? " anew" : "") + (outcome.blLeftOver ? " left over" : "");
     }
-    return rgTexts;
+    return szTold;
 }
 
 // The core with a memory of its own, at a time that only the test moves.
 struct Core {
-    tavo::PassResult Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted,
-                         const std::string& szHardware = "") {
+    const tavo::PassResult& Run(tavo::Router& router, const std::vector<RouterMapping>& rgWanted,
+                                const std::string& szHardware = "") {
         record.TurnTo({"192.168.1.1", szHardware});
-        return tavo::BringInLine(router, rgWanted, record, habit,
-                                 {szBox, [this] { return nNow; }, [this] { return nStopIn > 0 && --nStopIn == 0; },
-                                  [this] { return ++nSaves > 0 && !blDiskFull; },
-                                  [this](const RouterMapping&, const tavo::Step&) { ++nTold; }, mapOthers});
+        return result = tavo::BringInLine(router, rgWanted, record, habit,
+                                          {szBox, [this] { return nNow; },
+                                           [this] { return (nStopIn > 0 && --nStopIn == 0) || (fnStop && fnStop()); },
+                                           [this] { return ++nSaves > 0 && !blDiskFull; },
+                                           [this](const RouterMapping&, const tavo::Step&) { ++nTold; }, mapOthers});
     }
+    // What a pass tells | what the router then has | what is on record.
+    std::string Pass(MemoryRouter& router, const std::string& szWanted, const std::string& szHardware = "") {
+        Run(router, Parse(szWanted), szHardware);
+        return Told(result) + " | " + PlacesIn(router.mMapTable) + " | " + PlacesIn(record.Here());
+    }
+    tavo::Made& Known() {
+        record.TurnTo({"192.168.1.1", ""});
+        return record.Here()[{"TCP", 1}];
+    }
+    const tavo::Verdict& First() const { return result.rgOutcomes.at(0).verdict; }
+
+    tavo::PassResult result;
     std::map<tavo::MappingKey, uint16_t> mapOthers;
     std::string szBox = kBox;
     tavo::Record record{"", "boot"};
@@ -135,6 +196,7 @@ struct Core {
     int nSaves = 0;
     int nTold = 0;
     int nStopIn = 0;  // looks at the stop until there is one; 0: there is none
+    std::function<bool()> fnStop;
     bool blDiskFull = false;
 };
 
@@ -147,89 +209,58 @@ std::vector<RouterMapping> Wanted(int nPorts) {
 }
 
 TEST(Mapping, TouchesOnlyWhatIsOursAndComparesBeforeItWrites) {
-    MemoryRouter router;
-    for (const RouterMapping& mapping :
-         {Entry(1, 1, kBox, "tavo:a"), Entry(2, 2, kBox, "tavo:gone"), Entry(3, 9, kBox, "tavo:moved"),
-          Entry(4, 4, "192.168.1.9", "tavo:theirs"), Entry(5, 5, kBox, "game"), Entry(6, 9, kBox, "game")}) {
-        router.Put(mapping);
-    }
-    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a"), Entry(3, 3, "", "tavo:moved"),
-                                                 Entry(4, 4, "", "tavo:d"), Entry(5, 5, "", "tavo:e"),
-                                                 Entry(6, 6, "", "tavo:f"), Entry(7, 7, "", "tavo:g")};
+    MemoryRouter router("1 2 3>9 4@9=tavo:theirs 5=game 6>9=game");
     Core core;
-    const auto result = core.Run(router, rgWanted);
-    std::vector<std::string> rgExpected = {"1/tcp 1",
-                                           "3/tcp 1 anew",
-                                           "4/tcp 718 192.168.1.9 tavo:theirs",
-                                           "5/tcp 1 others",
-                                           "6/tcp 718 192.168.1.5 game others",
-                                           "7/tcp 1 anew"};
-    EXPECT_EQ(Texts(result), rgExpected);
-    EXPECT_EQ(router.mMapTable.size(), 6U);
-    EXPECT_EQ(router.mMapTable.count({"TCP", 2}), 0U);
-    EXPECT_EQ((router.mMapTable[{"TCP", 3}].nBoxPort), 3);
-    EXPECT_EQ((router.mMapTable[{"TCP", 6}].nBoxPort), 9);
-    EXPECT_EQ((router.mMapTable[{"TCP", 4}].szClient), "192.168.1.9");
+    const std::string szRest =
+        ", 4/tcp 718 192.168.1.9 tavo:theirs, 5/tcp 1 others, 6/tcp 718 192.168.1.5 game others, 7/tcp 1";
+    const std::string szAfter = " | 1 3 4@9 5 6>9 7 | 1 3 7";
+    EXPECT_EQ(core.Pass(router, "1 3 4 5 6 7"), "1/tcp 1, 3/tcp 1 anew" + szRest + " anew" + szAfter);
     EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), 3600U) << "of an age that nobody knows: renewed";
-    EXPECT_EQ(result.nNextSeconds, 100) << "the other program's lease ends before half of ours is over";
+    EXPECT_EQ(core.result.nNextSeconds, 100) << "the other program's lease ends before half of ours is over";
 
     router.mNCalls = 0;
-    rgExpected[1] = "3/tcp 1";
-    rgExpected[5] = "7/tcp 1";
-    EXPECT_EQ(Texts(core.Run(router, rgWanted)), rgExpected);
+    EXPECT_EQ(core.Pass(router, "1 3 4 5 6 7"), "1/tcp 1, 3/tcp 1" + szRest + szAfter);
     EXPECT_EQ(router.mNCalls, 1);
     router.mMapTable[{"TCP", 1}].nLease = 7;  // what is left, as some show it
     core.nNow += core.habit.nLease / 2 - 1;
-    core.Run(router, rgWanted);
+    core.Pass(router, "1 3 4 5 6 7");
     EXPECT_EQ(router.mNCalls, 2) << "not yet";
     core.nNow += 1;
-    core.Run(router, rgWanted);
+    core.Pass(router, "1 3 4 5 6 7");
     EXPECT_EQ((router.mMapTable[{"TCP", 1}].nLease), core.habit.nLease);
     EXPECT_EQ((router.mMapTable[{"TCP", 5}].szDescription), "game");
 }
 
 TEST(Mapping, ReadsBackByRangeAndAsksSinglyForWhatTheRangeDoesNotShow) {
-    const std::vector<RouterMapping> rgWanted = Wanted(10);
     // What the range answers, what it hides, what the router swallows: the calls for a listing, ten looks, ten
     // mappings and their proof, and the status of the fifth.
-    const std::tuple<int, int, int, int, const char*> rgCases[] = {
-        {tavo::kWireOk, 0, 0, 1 + 10 + 10 + 1, "1"},
-        {tavo::kWireOk, 5, 0, 1 + 10 + 10 + 1 + 1, "1"},
-        {tavo::kWireOk, 0, 5, 1 + 10 + 10 + 1 + 1, "lost"},
-        {tavo::kIgdInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 10, "lost"},
-        {tavo::kWireTimeout, 0, 0, 1 + 10 + 10 + 1 + 10, "1"}};
-    for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] : rgCases) {
+    for (const auto& [nCode, nHidden, nSwallowed, nCalls, szFifth] :
+         {std::tuple(int{tavo::kWireOk}, 0, 0, 1 + 10 + 10 + 1, "1"),
+          {tavo::kWireOk, 5, 0, 1 + 10 + 10 + 1 + 1, "1"},
+          {tavo::kWireOk, 0, 5, 1 + 10 + 10 + 1 + 1, "lost"},
+          {tavo::kIgdInvalidAction, 0, 5, 1 + 10 + 10 + 1 + 10, "lost"},
+          {tavo::kWireTimeout, 0, 0, 1 + 10 + 10 + 1 + 10, "1"}}) {
         MemoryRouter router;
         router.mNRangeCode = nCode;
         router.mNHidden = nHidden;
         router.mNSwallowed = nSwallowed;
-        const auto result = Core().Run(router, rgWanted);
+        const auto rgOutcomes = Core().Run(router, Wanted(10)).rgOutcomes;
         EXPECT_EQ(router.mNCalls, nCalls);
-        ASSERT_EQ(result.rgOutcomes.size(), 10U);
-        EXPECT_EQ(result.rgOutcomes[4].verdict.szWord, szFifth);
-        EXPECT_EQ(std::count_if(result.rgOutcomes.begin(), result.rgOutcomes.end(),
-                                [](const tavo::Outcome& outcome) { return outcome.verdict.szWord == "1"; }),
-                  nSwallowed == 0 ? 10 : 9);
+        ASSERT_EQ(rgOutcomes.size(), 10U);
+        for (size_t i = 0; i < 10; ++i) {
+            EXPECT_EQ(rgOutcomes[i].verdict.szWord, i == 4 ? szFifth : "1");
+        }
     }
 }
 
 // A widespread router daemon dies of a range with more than some hundred and thirty entries.
 TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
-    class Ranged : public MemoryRouter {
-    public:
-        RouterReply ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
-                              std::vector<RouterMapping>& rgMappings) override {
-            mRgszRanges.push_back(szProtocol + " " + std::to_string(nFirst) + "-" + std::to_string(nLast));
-            return MemoryRouter::ListRange(szProtocol, nFirst, nLast, rgMappings);
-        }
-        std::vector<std::string> mRgszRanges;
-    };
     std::vector<RouterMapping> rgWanted = Wanted(70);
-    for (const uint16_t nPort : {uint16_t{70}, uint16_t{71}, uint16_t{72}, uint16_t{73}, uint16_t{200}}) {
-        rgWanted.push_back(Entry(nPort, nPort, "", "tavo:a"));
+    for (const RouterMapping& mapping : Parse("70 71 72 73 200")) {
+        rgWanted.push_back(mapping);
         rgWanted.back().szProtocol = "UDP";
     }
-    Ranged router;
+    MemoryRouter router;
     router.mNRangeCode = tavo::kWireOk;
     Core().Run(router, rgWanted);
     EXPECT_EQ(router.mRgszRanges, (std::vector<std::string>{"TCP 1-64", "TCP 65-70", "UDP 70-73"}));
@@ -238,6 +269,7 @@ TEST(Mapping, ARangeIsOfOneProtocolAndOfAFewPorts) {
 // The pages of a router: entries are ranges, none is changed in place, and what was done takes effect together.
 class FormRouter : public MemoryRouter {
 public:
+    using MemoryRouter::MemoryRouter;
     tavo::Abilities What() const override { return {.blShows = mBlShows, .szConflict = "taken", .blForm = true}; }
     const RouterMapping* InTheWay(const RouterMapping& mapping) const {
         for (const auto& [key, entry] : mMapTable) {
@@ -319,21 +351,19 @@ TEST(Mapping, WhatABlindFormHasIsKnownWhateverWasAskedForSince) {
         router.mSzRewritten = "-";
         Core core;
         core.habit.nLease = 0;
-        core.Run(router, {Entry(4, 4, "", "tavo:c")});
+        core.Pass(router, "4");
         router.mBlApplies = false;
-        core.Run(router, {Entry(4, 9, "", "tavo:c")});
-        const int nCode = blSilent ? int{tavo::kWireTimeout} : int{tavo::kWireOk};
-        router.mNRemoveCode = router.mNAddCode = nCode;
+        core.Pass(router, "4>9");
+        router.mNRemoveCode = router.mNAddCode = blSilent ? int{tavo::kWireTimeout} : int{tavo::kWireOk};
         router.mBlSaysGone = blSaysGone;
-        core.Run(router, {Entry(4, blSilent ? 9 : 10, "", "tavo:c")});
+        core.Pass(router, blSilent ? "4>9" : "4>10");
         if (blSaysGone) {
-            core.Run(router, {});
+            core.Pass(router, "");
             router.mBlSaysGone = false;
         }
         router.mNRemoveCode = router.mNAddCode = tavo::kWireOk;
         router.mBlApplies = true;
-        core.Run(router, {});
-        EXPECT_TRUE(router.mMapTable.empty()) << blSilent << blSaysGone;
+        EXPECT_EQ(core.Pass(router, ""), " |  | ") << blSilent << blSaysGone;
     }
 }
 
@@ -347,62 +377,32 @@ TEST(Mapping, ARangeSaysNothingOfAFormerAddress) {
     router.mNHidden = 3;
     router.mBlKeepsRemoved = true;
     core.szBox = "192.168.1.6";
-    EXPECT_EQ(core.Run(router, {}).rgOutcomes.size(), 6U);
-    EXPECT_TRUE((core.record.Here().contains({"TCP", 3})));
-}
-
-RouterMapping Range(RouterMapping mapping, uint16_t nMore) {
-    mapping.nMore = nMore;
-    mapping.nLease = 0;
-    return mapping;
+    EXPECT_TRUE(core.Pass(router, "").ends_with(" | 1 2 3 4 5 6 | 1 2 3 4 5 6"));
+    EXPECT_EQ(core.result.rgOutcomes.size(), 6U);
 }
 
 TEST(Mapping, AFormIsFilledInAnewAndAppliedOnce) {
-    struct Case {
-        const char* szWhat;
-        bool blApplies;
-        uint16_t nTornAway;
-        std::vector<std::string> rgExpected;
-    };
-    const std::string szTaken = "30-32/tcp taken 192.168.1.9 tavo:theirs";
-    for (const Case& row :
-         {Case{"all is well", true, 0, {"1/tcp 1", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}},
-          Case{"nothing takes effect",
-               false,
-               0,
-               {"1/tcp not applied", "10-11/tcp not applied", "20/tcp not applied", szTaken,
-                "10-11/tcp not applied left over", "20/tcp not applied left over", "50-51/tcp not applied left over"}},
-          Case{"another one goes with what is taken away",
-               true,
-               1,
-               {"1/tcp lost", "10-11/tcp 1 anew", "20/tcp 1 anew", szTaken}}}) {
-        SCOPED_TRACE(row.szWhat);
-        FormRouter router;
-        for (const RouterMapping& mapping :
-             {Range(Entry(1, 1, kBox, "tavo:a"), 0), Range(Entry(10, 10, kBox, "tavo:b"), 5),
-              Range(Entry(20, 9, kBox, "tavo:c"), 0), Range(Entry(31, 31, "192.168.1.9", "tavo:theirs"), 9),
-              Range(Entry(50, 50, kBox, "tavo:gone"), 1)}) {
-            router.Put(mapping);
-        }
-        router.mBlApplies = row.blApplies;
-        router.mNTornAway = row.nTornAway;
+    const std::string szTaken = ", 30-32/tcp taken 192.168.1.9 tavo:theirs";
+    const std::string szAllIsWell = "10-11/tcp 1 anew, 20/tcp 1 anew" + szTaken;
+    for (const auto& [blApplies, nTornAway, szPassed] :
+         {std::tuple(true, uint16_t{0}, "1/tcp 1, " + szAllIsWell + " | 1 10+1 20 31+9@9 | 1 10+1 20"),
+          {false, 0,
+           "1/tcp not applied, 10-11/tcp not applied, 20/tcp not applied" + szTaken +
+               ", 10-11/tcp not applied left over, 20/tcp not applied left over, 50-51/tcp not applied left over"
+               " | 1 10+5 20>9 31+9@9 50+1 | 1 10+1 20 50+1"},
+          // another one goes with what is taken away
+          {true, 1, "1/tcp lost, " + szAllIsWell + " | 10+1 20 31+9@9 | 10+1 20"}}) {
+        FormRouter router("1+0 10+5 20+0>9 31+9@9=tavo:theirs 50+1");
+        router.mBlApplies = blApplies;
+        router.mNTornAway = nTornAway;
         Core core;
-        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a"), Range(Entry(10, 10, "", "tavo:b"), 1),
-                                              Entry(20, 20, "", "tavo:c"), Range(Entry(30, 30, "", "tavo:d"), 2)});
-        EXPECT_EQ(Texts(result), row.rgExpected);
+        EXPECT_EQ(core.Pass(router, "1 10+1 20 30+2"), szPassed);
         EXPECT_EQ(router.mNApplied, 1);
-        EXPECT_EQ((router.mMapTable[{"TCP", 10}].nMore), row.blApplies ? 1 : 5);
-        EXPECT_EQ((router.mMapTable[{"TCP", 31}].nMore), 9);
-        EXPECT_NE((router.mMapTable.contains({"TCP", 50})), row.blApplies);
-        EXPECT_NE((core.record.Here().contains({"TCP", 50})), row.blApplies);
-        EXPECT_FALSE((core.record.Here().contains({"TCP", 30}))) << "what could not be made is nothing of ours";
-        EXPECT_EQ((core.record.Here()[{"TCP", 10}].nMore), 1);
-        if (row.blApplies && row.nTornAway == 0) {
-            router.Put(Range(Entry(60, 60, kBox, "game"), 0));
-            const std::vector<RouterMapping> rgKept = {Entry(20, 20, "", "tavo:c"), Entry(60, 60, "", "tavo:d")};
-            core.Run(router, rgKept);
+        if (blApplies && nTornAway == 0) {
+            router.Put(Parse("60+0=game", kBox)[0]);
+            core.Pass(router, "20 60");
             router.mNCalls = 0;
-            EXPECT_EQ(Texts(core.Run(router, rgKept)), (Rows{"20/tcp 1", "60/tcp 1 others"}));
+            EXPECT_EQ(core.Pass(router, "20 60"), "20/tcp 1, 60/tcp 1 others | 20 31+9@9 60 | 20");
             EXPECT_EQ(router.mNCalls, 3) << "the list, and one look at each once that is applied";
         }
     }
@@ -417,18 +417,13 @@ TEST(Mapping, AFormHasDoneNothingUntilItIsApplied) {
         router.mSzRewritten = "-";
         Core core;
         core.habit.nLease = 0;
-        core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b"), Entry(4, 4, "", "tavo:c")});
-        const auto mapBefore = router.mMapTable;
-        ASSERT_EQ(mapBefore.size(), 3U);
+        EXPECT_EQ(core.Pass(router, "1 2 4"), "1/tcp 1 anew, 2/tcp 1 anew, 4/tcp 1 anew | 1 2 4 | 1 2 4");
         router.mBlApplies = false;
-        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b"), Entry(4, 9, "", "tavo:c")})),
-                  (std::vector<std::string>{"2/tcp not applied", "4/tcp not applied", "1/tcp not applied left over",
-                                            "4/tcp not applied left over"}));
-        ASSERT_EQ(router.mMapTable.size(), 3U);
+        EXPECT_EQ(core.Pass(router, "2 4>9"),
+                  "2/tcp not applied, 4/tcp not applied, 1/tcp not applied left over, 4/tcp not applied left over"
+                  " | 1 2 4 | 1 2 4>9");
         router.mBlApplies = true;
-        EXPECT_EQ(core.Run(router, {Entry(2, 2, "", "tavo:b")}).rgOutcomes.size(), 1U);
-        EXPECT_EQ(router.mMapTable.size(), 1U);
-        EXPECT_EQ(core.record.Here().size(), 1U);
+        EXPECT_EQ(core.Pass(router, "2"), blShows ? "2/tcp 1 | 2 | 2" : "2/tcp 1 anew | 2 | 2");
     }
 }
 
@@ -438,51 +433,38 @@ TEST(Mapping, AFormThatHidesClientsIsFilledInAnewForANewAddress) {
     router.mBlHidesClient = true;
     Core core;
     core.habit.nLease = 0;
-    core.Run(router, {Entry(2, 2, "", "tavo:b")});
+    core.Pass(router, "2");
     core.szBox = "192.168.1.6";
     router.mBlApplies = false;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})).front(), "2/tcp not applied");
+    EXPECT_TRUE(core.Pass(router, "2").starts_with("2/tcp not applied"));
     router.mBlApplies = true;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), Rows{"2/tcp 1 anew"});
-    EXPECT_EQ((router.mMapTable[{"TCP", 2}].szClient), core.szBox);
+    EXPECT_EQ(core.Pass(router, "2"), "2/tcp 1 anew | 2@6 | 2@6");
 }
 
 // A list without names, or without addresses: ours is what the record knows, and what looks like it no more.
 TEST(Mapping, WhatAListLeavesOutTheRecordKnows) {
-    struct Case {
-        const char* szShownClient;
-        const char* szShownText;
-        uint16_t nShownMore;
-        bool blOurs;
-    };
-    for (const Case& row : {Case{"", "tavo:a", 2, true}, Case{"", "", 2, true}, Case{kBox, "", 2, true},
-                            Case{"192.168.1.9", "", 2, false}, Case{"", "game", 2, false}, Case{kBox, "", 3, false}}) {
+    const std::string szBox = kBox;
+    for (const auto& [szClient, szText, nMore, blOurs] : {std::tuple(std::string(), "tavo:a", 2, true),
+                                                          {"", "", 2, true},
+                                                          {szBox, "", 2, true},
+                                                          {"192.168.1.9", "", 2, false},
+                                                          {"", "game", 2, false},
+                                                          {szBox, "", 3, false}}) {
         for (const bool blKnown : {true, false}) {
-            SCOPED_TRACE(std::string(row.szShownClient) + "/" + row.szShownText + (blKnown ? " known" : ""));
+            SCOPED_TRACE(szClient + "/" + szText + (blKnown ? " known" : ""));
             FormRouter router;
-            router.Put(Range(Entry(1, 1, row.szShownClient, row.szShownText), row.nShownMore));
+            RouterMapping& there = router.Put(Parse("1+" + std::to_string(nMore), szClient)[0]);
+            there.szDescription = szText;
             Core core;
-            core.record.TurnTo({"192.168.1.1", ""});
             if (blKnown) {
-                tavo::Made& made = core.record.Here()[{"TCP", 1}];
-                made = {kBox, 1, row.szShownText};
-                made.nMore = 2;
+                core.Known() = {.szClient = kBox, .nBoxPort = 1, .szText = szText, .nMore = 2};
             }
-            const std::vector<RouterMapping> rgWanted = {Range(Entry(1, 1, "", "tavo:a"), 2)};
-            const bool blServes = (blKnown && row.blOurs) || (kBox == std::string(row.szShownClient) && row.blOurs);
-            EXPECT_EQ(core.Run(router, rgWanted).rgOutcomes[0].verdict.szWord, blServes ? "1" : "taken");
-            core.Run(router, {});
-            EXPECT_EQ(router.mMapTable.empty(), blKnown && row.blOurs);
+            core.Pass(router, "1+2=tavo:a");
+            EXPECT_EQ(core.First().szWord, blOurs && (blKnown || szClient == szBox) ? "1" : "taken");
+            core.Pass(router, "");
+            EXPECT_EQ(router.mMapTable.empty(), blKnown && blOurs);
         }
     }
-}
-
-TEST(Mapping, WhatTheRouterDoesNotTakeAwayIsReported) {
-    MemoryRouter router;
-    router.Put(Entry(1, 1, kBox, "tavo:old"));
-    router.Put(Entry(2, 9, kBox, "tavo:moved"));
-    router.mNRemoveCode = 606;
-    EXPECT_EQ(Texts(Core().Run(router, {})), (std::vector<std::string>{"1/tcp 606 left over", "2/tcp 606 left over"}));
 }
 
 // Some say yes and keep it, for ever or for a while; another's yes is as good as what it shows.
@@ -492,25 +474,21 @@ TEST(Mapping, AYesToARemovalIsLookedAt) {
         router.mNListCode = nListCode;
         router.mSzRewritten = "upnp";
         Core core;
-        core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")});
+        core.Pass(router, "1 2");
         router.mBlKeepsRemoved = true;
         for (int i = 0; i < 2; ++i) {
             core.nTold = 0;
-            EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})),
-                      (std::vector<std::string>{"2/tcp 1", "1/tcp kept left over"}));
-            EXPECT_TRUE((core.record.Here().contains({"TCP", 1})));
+            EXPECT_EQ(core.Pass(router, "2"), "2/tcp 1, 1/tcp kept left over | 1 2 | 1 2");
             EXPECT_EQ(core.nTold, 0) << "nothing has changed";
         }
-        for (core.nStopIn = 1; core.nStopIn < 8; ++core.nStopIn) {
-            const int nStopIn = core.nStopIn;
-            core.Run(router, {});
-            EXPECT_TRUE((core.record.Here().contains({"TCP", 1}))) << "stopped at look " << nStopIn;
+        for (int nStopIn = 1; nStopIn < 8; ++nStopIn) {
             core.nStopIn = nStopIn;
+            core.Pass(router, "");
+            EXPECT_TRUE((core.record.Here().contains({"TCP", 1}))) << "stopped at look " << nStopIn;
         }
         core.nStopIn = 0;
         router.mMapTable.erase({"TCP", 1});
-        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
-        EXPECT_FALSE((core.record.Here().contains({"TCP", 1})));
+        EXPECT_EQ(core.Pass(router, "2"), "2/tcp 1 | 2 | 2");
     }
 }
 
@@ -519,62 +497,49 @@ TEST(Mapping, WhatAnotherDaemonSeesToStays) {
     for (const uint16_t nBoxPort : {uint16_t{1}, uint16_t{9}}) {
         MemoryRouter router;
         Core core;
-        core.Run(router, {Entry(1, 1, "", "tavo:a")});
+        core.Pass(router, "1");
         core.mapOthers = {{{"TCP", 1}, nBoxPort}};
-        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-        EXPECT_EQ(router.mMapTable.size(), nBoxPort == 1 ? 1U : 0U);
+        EXPECT_EQ(core.Pass(router, ""), nBoxPort == 1 ? " | 1 | 1" : " |  | ");
     }
 }
 
 // One answer that does not come is asked for again, or leaves open what came of a removal.
 TEST(Mapping, ALookThatIsNotAnsweredSaysNothing) {
-    struct Mute : MemoryRouter {
-        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
-            return nSilent > 0 && nSilent-- > 0 ? IgdReply(tavo::kWireTimeout)
-                                                : MemoryRouter::Get(szProtocol, nPort, mapping);
-        }
-        int nSilent = 0;
-    };
-    Mute router;
+    MemoryRouter router;
     Core core;
+    int nSilent = 1;
+    router.mFnGet = [&nSilent](uint16_t) {
+        return nSilent > 0 && nSilent-- > 0 ? std::optional(IgdReply(tavo::kWireTimeout)) : std::nullopt;
+    };
     router.mNListCode = 401;
-    router.nSilent = 1;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1 anew"});
+    EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 anew | 1 | 1");
     router.mNListCode = tavo::kWireOk;
     router.Put(Entry(2, 2, "192.168.1.9", "game"));
     router.Put(Entry(3, 3, "192.168.1.9", "game"));
-    router.nSilent = 1;
-    EXPECT_EQ(Texts(core.Run(router, {})), Rows{"1/tcp timeout left over"});
-    EXPECT_TRUE(core.record.Here().contains({"TCP", 1}));
-    EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-    EXPECT_TRUE(core.record.Here().empty());
+    nSilent = 1;
+    EXPECT_EQ(core.Pass(router, ""), "1/tcp timeout left over | 2@9 3@9 | 1");
+    EXPECT_EQ(core.Pass(router, ""), " | 2@9 3@9 | ");
 }
 
 TEST(Mapping, ALookAtManyRemovalsCostsLittle) {
-    const struct {
-        int nRangeCode;
-        int nHidden;
-        int nEntries;
-        int nCalls;  // of a pass that takes away ten of them
-        int nKept;   // of one whose router keeps them
-    } rgCases[] = {{tavo::kWireOk, 0, 30, 1 + 10 + 1 + 1, 1 + 10 + 1},
-                   {tavo::kWireOk, 0, 10, 1 + 10 + 1 + 1, 1 + 10 + 1},
-                   {tavo::kWireOk, -1, 30, 1 + 10 + 1 + 1, 1 + 10 + 1 + 10},
-                   {tavo::kIgdInvalidAction, 0, 30, 1 + 10 + 1 + 10, 1 + 10 + 1 + 10},
-                   {tavo::kIgdInvalidAction, 0, 10, 1 + 10 + 1 + 1, 1 + 10 + 1 + 1}};
-    for (const auto& row : rgCases) {
+    // What the range answers, what it hides, how many entries there are; the calls of a pass that takes away ten of
+    // them, and of one whose router keeps them.
+    for (const auto& [nRangeCode, nHidden, nEntries, nCalls, nKept] :
+         {std::tuple(int{tavo::kWireOk}, 0, 30, 1 + 10 + 1 + 1, 1 + 10 + 1),
+          {tavo::kWireOk, 0, 10, 1 + 10 + 1 + 1, 1 + 10 + 1},
+          {tavo::kWireOk, -1, 30, 1 + 10 + 1 + 1, 1 + 10 + 1 + 10},
+          {tavo::kIgdInvalidAction, 0, 30, 1 + 10 + 1 + 10, 1 + 10 + 1 + 10},
+          {tavo::kIgdInvalidAction, 0, 10, 1 + 10 + 1 + 1, 1 + 10 + 1 + 1}}) {
         for (const bool blKeeps : {false, true}) {
-            MemoryRouter router;
-            router.mNRangeCode = row.nRangeCode;
-            router.mNHidden = row.nHidden;
-            for (int i = 1; i <= row.nEntries; ++i) {
-                const auto nPort = static_cast<uint16_t>(i);
-                router.Put(Entry(nPort, nPort, i <= 10 ? kBox : "192.168.1.9", i <= 10 ? "tavo:a" : "game"));
+            MemoryRouter router("1 2 3 4 5 6 7 8 9 10");
+            router.mNRangeCode = nRangeCode;
+            router.mNHidden = nHidden;
+            for (int i = 11; i <= nEntries; ++i) {
+                router.Put(Entry(static_cast<uint16_t>(i), 1, "192.168.1.9", "game"));
             }
             router.mBlKeepsRemoved = blKeeps;
-            const auto result = Core().Run(router, {});
-            EXPECT_EQ(result.rgOutcomes.size(), blKeeps ? 10U : 0U) << row.nRangeCode << " " << row.nHidden;
-            EXPECT_EQ(router.mNCalls, blKeeps ? row.nKept : row.nCalls) << row.nRangeCode << " " << row.nEntries;
+            EXPECT_EQ(Core().Run(router, {}).rgOutcomes.size(), blKeeps ? 10U : 0U) << nRangeCode << " " << nHidden;
+            EXPECT_EQ(router.mNCalls, blKeeps ? nKept : nCalls) << nRangeCode << " " << nEntries;
         }
     }
 }
@@ -588,17 +553,13 @@ TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
         router.mNListCode = nListCode;
         router.mBlListNothing = true;
         router.mSzRewritten = "upnp";
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")})),
-                  (std::vector<std::string>{"1/tcp 1 anew", "2/tcp 1 anew"}));
-        EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})), std::vector<std::string>{"2/tcp 1"});
-        EXPECT_EQ(router.mMapTable.size(), 1U);
+        EXPECT_EQ(core.Pass(router, "1 2"), "1/tcp 1 anew, 2/tcp 1 anew | 1 2 | 1 2");
+        EXPECT_EQ(core.Pass(router, "2"), "2/tcp 1 | 2 | 2");
         router.mMapTable[{"TCP", 2}].szClient = "192.168.1.9";
-        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-        EXPECT_EQ(router.mMapTable.size(), 1U) << "another host has it by now";
-        EXPECT_TRUE(core.record.Here().empty());
+        EXPECT_EQ(core.Pass(router, ""), " | 2@9 | ") << "another host has it by now";
         router.mNGetCode = tavo::kWireTimeout;
         router.mNCalls = 0;
-        core.Run(router, Wanted(3));
+        core.Pass(router, "1 2 3");
         EXPECT_EQ(router.mNCalls, nListCode == 401 ? 3 : 2) << "two answers in a row that do not come end a pass";
     }
 }
@@ -606,163 +567,141 @@ TEST(Mapping, WithoutAListingTheRecordKnowsWhatIsOurs) {
 // A router that says yes to the removal, keeps the entry for the former address, and refuses the new one for its sake:
 // whatever comes in between, the entry is known, and named when its rule has gone.
 TEST(Mapping, WhatIsKeptForAFormerAddressStaysOnRecord) {
-    class Guarding : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
-            mSzAtAsking = mRecord.Text();
-            const auto it = mMapTable.find(tavo::KeyOf(mapping));
-            const bool blTaken = it != mMapTable.end() && it->second.szClient != mapping.szClient;
-            return blTaken ? (mBlLies ? RouterReply{} : IgdReply(718)) : MemoryRouter::Add(mapping);
-        }
-        explicit Guarding(const tavo::Record& record) : mRecord(record) {}
-        bool mBlLies = false;  // about this, too
-        const tavo::Record& mRecord;
-        std::string mSzAtAsking;
-    };
-    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
     for (const std::string szCase : {"refused", "full disk", "yes to all", "killed"}) {
         SCOPED_TRACE(szCase);
         Core core;
-        Guarding router(core.record);
+        MemoryRouter router;
+        std::string szAtAsking;
+        router.mFnAdd = [&](const RouterMapping& mapping) -> std::optional<RouterReply> {
+            szAtAsking = core.record.Text();
+            const auto it = router.mMapTable.find(tavo::KeyOf(mapping));
+            if (it == router.mMapTable.end() || it->second.szClient == mapping.szClient) {
+                return std::nullopt;
+            }
+            return szCase == "yes to all" ? RouterReply{} : IgdReply(718);
+        };
         router.mSzRewritten = "upnp";
-        core.Run(router, rgWanted);
+        core.Pass(router, "1");
         core.szBox = "192.168.1.6";
         router.mBlKeepsRemoved = true;
-        router.mBlLies = szCase == "yes to all";
         core.blDiskFull = szCase == "full disk";
         for (int i = 0; i < 2; ++i) {
-            EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{core.blDiskFull ? "1/tcp unrecorded" : "1/tcp kept"});
-            EXPECT_EQ(core.record.Here().at({"TCP", 1}).szClient, kBox);
+            EXPECT_EQ(core.Pass(router, "1"), core.blDiskFull ? "1/tcp unrecorded | 1 | 1" : "1/tcp kept | 1 | 1");
         }
         if (szCase == "killed") {  // before the answer to the asking
-            core.record = tavo::Record(router.mSzAtAsking, "boot");
+            core.record = tavo::Record(szAtAsking, "boot");
         }
-        EXPECT_EQ(Texts(core.Run(router, {})), Rows{"1/tcp kept left over"});
+        EXPECT_TRUE(core.Pass(router, "").starts_with("1/tcp kept left over | 1 | 1"));
         router.mBlKeepsRemoved = false;
-        EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-        EXPECT_TRUE(core.record.Here().empty());
+        EXPECT_EQ(core.Pass(router, ""), " |  | ");
     }
 }
 
 TEST(Mapping, AFormerAddressIsTakenAwayFirstOrWaitedFor) {
     for (const bool blRefuses : {false, true}) {
-        MemoryRouter router;
+        MemoryRouter router("1@4=upnp");
         Core core;
-        router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
-        core.record.TurnTo({"192.168.1.1", ""});
-        core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow};
+        core.Known() = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow};
         router.mNRemoveCode = blRefuses ? 606 : tavo::kWireOk;
-        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
-        EXPECT_EQ(Texts(result), std::vector<std::string>{blRefuses ? "1/tcp 606" : "1/tcp 1 anew"});
-        EXPECT_EQ((router.mMapTable[{"TCP", 1}].szClient), blRefuses ? "192.168.1.4" : kBox);
+        EXPECT_EQ(core.Pass(router, "1"), blRefuses ? "1/tcp 606 | 1@4 | 1@4" : "1/tcp 1 anew | 1 | 1");
         if (blRefuses) {
-            EXPECT_EQ(result.rgOutcomes[0].verdict.enState, tavo::PortState::kWaiting);
-            EXPECT_EQ(result.rgOutcomes[0].verdict.nLease, 3600U);
-            EXPECT_EQ(result.nNextSeconds, 3601);
+            EXPECT_EQ(core.First().enState, tavo::PortState::kWaiting);
+            EXPECT_EQ(core.First().nLease, 3600U);
+            EXPECT_EQ(core.result.nNextSeconds, 3601);
             router.mMapTable.clear();  // its lease has ended
-            EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
+            EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 anew | 1 | 1");
         }
     }
 }
 
 TEST(Mapping, CodesAndNothingButCodesAreNoRouterThatServes) {
     MemoryRouter router;
-    router.mNListCode = 501;
-    router.mBlListNothing = true;
-    router.mNGetCode = 501;
-    router.mNAddCode = 501;
+    router.mNListCode = router.mNGetCode = router.mNAddCode = router.mNRemoveCode = 501;
     Core core;
-    core.record.TurnTo({"192.168.1.1", ""});
-    core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow};
-    router.mNRemoveCode = 501;
-    const auto result = core.Run(router, {});
-    EXPECT_EQ(result.transport.enReply, tavo::Reply::kGarbage);
-    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 501 left over"});
+    core.Known() = {kBox, 1, "tavo:a", true, 3600, core.nNow};
+    EXPECT_EQ(core.Pass(router, ""), "1/tcp 501 left over |  | 1");
+    EXPECT_EQ(core.result.transport.enReply, tavo::Reply::kGarbage);
 }
 
-// Whoever takes an entry away while the table is read moves those that follow: some are not shown.
-TEST(Mapping, WhatAListingLeavesOutMayBeThere) {
-    MemoryRouter router;
-    Core core;
-    router.mSzRewritten = "upnp";
-    core.Run(router, {Entry(1, 1, "", "tavo:a")});
-    router.mMapTable[{"TCP", 2}] = Entry(2, 9, kBox, "upnp");  // another program's
-    router.mBlListNothing = true;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(2, 2, "", "tavo:b")})),
-              std::vector<std::string>{"2/tcp 718 192.168.1.5 upnp others"});
-    EXPECT_FALSE(router.mMapTable.contains({"TCP", 1})) << "known, and taken away";
-    EXPECT_EQ((router.mMapTable[{"TCP", 2}].nBoxPort), 9);
-}
-
-TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
-    class Stubborn : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
-            return mMapTable.contains(tavo::KeyOf(mapping)) ? RouterReply() : MemoryRouter::Add(mapping);
-        }
-    };
-    for (const char* szText : {"", "upnp"}) {
-        Stubborn router;
+// Who has what is there, seen in one pass; what comes of it is told, and nobody else's is touched.
+TEST(Mapping, WhoseAnEntryIsDecidesWhatBecomesOfIt) {
+    {
+        SCOPED_TRACE("what the router does not take away is reported");
+        MemoryRouter router("1=tavo:old 2>9=tavo:moved");
+        router.mNRemoveCode = 606;
+        EXPECT_EQ(Core().Pass(router, ""), "1/tcp 606 left over, 2/tcp 606 left over | 1 2>9 | ");
+    }
+    {
+        SCOPED_TRACE("whoever takes an entry away while the table is read moves those that follow: some are not shown");
+        MemoryRouter router;
         Core core;
-        router.mSzRewritten = szText;
-        core.Run(router, {Entry(1, 1, "", "tavo:a")});
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 2, "", "tavo:a")})), std::vector<std::string>{"1/tcp 1 anew"});
-        EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 2);
-        core.Run(router, {});
-        EXPECT_TRUE(router.mMapTable.empty());
+        router.mSzRewritten = "upnp";
+        core.Pass(router, "1");
+        router.Put(Entry(2, 9, kBox, "upnp"));  // another program's
+        router.mBlListNothing = true;
+        EXPECT_EQ(core.Pass(router, "2"), "2/tcp 718 192.168.1.5 upnp others | 2>9 | ");
+    }
+    {
+        SCOPED_TRACE("what another host took meanwhile is its own");
+        MemoryRouter router;
+        router.mFnAdd = [&router](const RouterMapping&) {
+            router.Put(Entry(1, 9, "192.168.1.9", "game"));
+            return RouterReply{};
+        };
+        EXPECT_EQ(Core().Pass(router, "1"), "1/tcp 718 192.168.1.9 game | 1>9@9 | ");
+    }
+    {
+        SCOPED_TRACE(
+            "a change was asked for, the process died, the router restarted, and another program has the place");
+        MemoryRouter router("1>9=upnp");  // a text that the router gives to everybody's proves nothing
+        router.mSzRewritten = "upnp";
+        Core core;
+        core.Known() = {kBox, 1, "upnp", false, 3600, core.nNow};
+        EXPECT_EQ(core.Pass(router, ""), " | 1>9 | ");
     }
 }
 
-TEST(Mapping, WhatAnotherHostTookMeanwhileIsItsOwn) {
-    class Robbed : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
-            Put(Entry(mapping.nRouterPort, 9, "192.168.1.9", "game"));
-            return {};
-        }
-    };
-    Robbed router;
-    Core core;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 718 192.168.1.9 game"});
-    EXPECT_TRUE(core.record.Here().empty());
+TEST(Mapping, AYesToAChangeThatWasNotMadeIsFollowedByANewOne) {
+    for (const char* szText : {"", "upnp"}) {
+        MemoryRouter router;
+        router.mFnAdd = [&router](const RouterMapping& mapping) {
+            return router.mMapTable.contains(tavo::KeyOf(mapping)) ? std::optional(RouterReply()) : std::nullopt;
+        };
+        Core core;
+        router.mSzRewritten = szText;
+        core.Pass(router, "1");
+        EXPECT_EQ(core.Pass(router, "1>2"), "1/tcp 1 anew | 1>2 | 1>2");
+        EXPECT_EQ(core.Pass(router, ""), " |  | ");
+    }
 }
 
 // With a text of its own, by which nobody knows whose it is.
 TEST(Mapping, WhatIsShownOnlyAfterAWhileIsOurs) {
-    class Slow : public MemoryRouter {
-    public:
-        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
-            return mBlShows ? MemoryRouter::Get(szProtocol, nPort, mapping) : IgdReply(tavo::kIgdNoSuchEntry);
-        }
-        bool mBlShows = false;
-    };
     for (const bool blWanted : {true, false}) {
-        Slow router;
+        MemoryRouter router;
+        bool blShows = false;
+        router.mFnGet = [&blShows](uint16_t) {
+            return blShows ? std::nullopt : std::optional(IgdReply(tavo::kIgdNoSuchEntry));
+        };
         Core core;
         router.mSzRewritten = "upnp";
-        const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
-        EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp lost"});
-        router.mBlShows = true;
+        EXPECT_EQ(core.Pass(router, "1"), "1/tcp lost | 1 | 1");
+        blShows = true;
         if (blWanted) {
-            EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp 1"});
+            EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 | 1 | 1");
         }
-        core.Run(router, {});
-        EXPECT_TRUE(router.mMapTable.empty());
-        EXPECT_TRUE(core.record.Here().empty());
+        EXPECT_EQ(core.Pass(router, ""), " |  | ");
 
         router.mNSwallowed = 1;
-        EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp lost"});
-        core.Run(router, {});
-        EXPECT_TRUE(core.record.Here().empty()) << "a later look has shown nothing";
+        EXPECT_EQ(core.Pass(router, "1"), "1/tcp lost |  | 1");
+        EXPECT_EQ(core.Pass(router, ""), " |  | ") << "a later look has shown nothing";
 
         router.mNSwallowed = 0;  // its rule goes before it is shown
-        router.mBlShows = false;
-        core.Run(router, rgWanted);
+        blShows = false;
+        core.Pass(router, "1");
         router.mBlListNothing = true;
         core.nNow += 2;
-        core.Run(router, {});
-        EXPECT_TRUE(router.mMapTable.empty());
-        EXPECT_TRUE(core.record.Here().empty());
+        EXPECT_EQ(core.Pass(router, ""), " |  | ");
     }
 }
 
@@ -771,121 +710,87 @@ TEST(Mapping, WhatWasLostIsSomebodyElsesLater) {
     MemoryRouter router;
     Core core;
     router.mNSwallowed = 1;
-    const std::vector<RouterMapping> rgWanted = {Entry(1, 1, "", "tavo:a")};
-    const auto result = core.Run(router, rgWanted);
-    EXPECT_EQ(Texts(result), Rows{"1/tcp lost"});
-    EXPECT_EQ(result.nNextSeconds, 10) << "for one more look";
+    EXPECT_EQ(core.Pass(router, "1"), "1/tcp lost |  | 1");
+    EXPECT_EQ(core.result.nNextSeconds, 10) << "for one more look";
     // Seconds until the next pass, what is then to be waited for, and whether it asked for the mapping.
     for (const auto& [nLater, nNext, blAsks] :
          {std::tuple{4, 6, false}, {6, 0, false}, {110, 10, true}, {10, 0, false}}) {
         core.nNow += nLater;
-        const int nCalls = router.mNCalls;
-        const auto later = core.Run(router, rgWanted);
-        EXPECT_EQ(Texts(later), Rows{"1/tcp lost"});
-        EXPECT_EQ(later.nNextSeconds, nNext);
-        EXPECT_EQ(router.mNCalls - nCalls > 2, blAsks);
+        router.mNCalls = 0;
+        EXPECT_TRUE(core.Pass(router, "1").starts_with("1/tcp lost |  |"));
+        EXPECT_EQ(core.result.nNextSeconds, nNext);
+        EXPECT_EQ(router.mNCalls > 2, blAsks);
     }
     router.Put(Entry(1, 1, kBox, "game"));
-    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"1/tcp 1 others"});
-    core.Run(router, {});
-    EXPECT_EQ(router.mMapTable.size(), 1U);
-}
-
-// The change was asked for, the process died, the router restarted, and another program has the place.
-TEST(Mapping, ATextThatTheRouterGivesToEverybodysProvesNothing) {
-    MemoryRouter router;
-    Core core;
-    router.mSzRewritten = "upnp";
-    core.record.TurnTo({"192.168.1.1", ""});
-    core.record.Here()[{"TCP", 1}] = {kBox, 1, "upnp", false, 3600, core.nNow};
-    router.mMapTable[{"TCP", 1}] = Entry(1, 9, kBox, "upnp");
-    EXPECT_TRUE(core.Run(router, {}).rgOutcomes.empty());
-    EXPECT_EQ(router.mMapTable.size(), 1U);
+    EXPECT_TRUE(core.Pass(router, "1").starts_with("1/tcp 1 others | 1 |"));
+    EXPECT_TRUE(core.Pass(router, "").starts_with(" | 1 |"));
 }
 
 TEST(Mapping, AStopInTheMiddleLosesNothing) {
     for (const bool blPermanentOnly : {false, true}) {
         MemoryRouter router;
-        tavo::Record record("", "boot");
-        tavo::Habits habit{.blPermanentOnly = blPermanentOnly};
-        record.TurnTo({"192.168.1.1", ""});
-        const auto result = tavo::BringInLine(
-            router, {Entry(1, 1, "", "tavo:a"), Entry(2, 2, "", "tavo:b")}, record, habit,
-            {kBox, [] { return 1000; }, [&] { return router.mMapTable.size() == 1; }, [] { return true; }});
-        EXPECT_EQ(Texts(result), (std::vector<std::string>{"1/tcp stopped", "2/tcp stopped"}));
-        EXPECT_TRUE(record.Here().contains({"TCP", 1}));
-        EXPECT_EQ(record.Here().at({"TCP", 2}).nLease, blPermanentOnly ? 0U : 3600U) << "as it is to be asked for";
+        Core core;
+        core.habit.blPermanentOnly = blPermanentOnly;
+        core.fnStop = [&router] { return router.mMapTable.size() == 1; };
+        EXPECT_EQ(core.Pass(router, "1 2"), "1/tcp stopped, 2/tcp stopped | 1 | 1 2");
+        EXPECT_EQ(core.record.Here().at({"TCP", 2}).nLease, blPermanentOnly ? 0U : 3600U) << "as it is to be asked for";
     }
 }
 
 // A port whose answer was lost does not wait for the next check, which may be an hour away.
 TEST(Mapping, AnAnswerThatIsLostIsAskedForAgainSoon) {
-    class Lossy : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
-            MemoryRouter::Add(mapping);
-            return IgdReply(tavo::kWireTimeout);
-        }
+    MemoryRouter router;
+    router.mFnAdd = [&router](const RouterMapping& mapping) {
+        router.Put(mapping);
+        return IgdReply(tavo::kWireTimeout);
     };
-    Lossy router;
-    const auto result = Core().Run(router, {Entry(1, 1, "", "tavo:a")});
-    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp timeout"});
-    EXPECT_TRUE(result.transport.IsOk());
-    EXPECT_EQ(result.nNextSeconds, 10);
+    Core core;
+    EXPECT_EQ(core.Pass(router, "1"), "1/tcp timeout | 1 | 1");
+    EXPECT_TRUE(core.result.transport.IsOk());
+    EXPECT_EQ(core.result.nNextSeconds, 10);
 }
 
 // What is to lead elsewhere cannot be noted down, so that it goes on as it was: that is said of the port.
 TEST(Mapping, WithoutARecordAPortThatIsOpenIsNamedAsItIs) {
     MemoryRouter router;
     Core core;
-    core.Run(router, {Entry(1, 7, "", "tavo:a")});
+    core.Pass(router, "1>7");
     core.blDiskFull = true;
-    const auto result = core.Run(router, {Entry(1, 2, "", "tavo:a"), Entry(3, 3, "", "tavo:b")});
-    EXPECT_EQ(Texts(result), (Rows{"1/tcp unrecorded", "3/tcp unrecorded"}));
-    EXPECT_TRUE(
-        WhyOf(result.rgOutcomes[0].verdict).starts_with("it still leads to port 7 of 192.168.1.5, as before: "));
-    EXPECT_TRUE(WhyOf(result.rgOutcomes[1].verdict).starts_with("this box cannot note down"));
-    EXPECT_EQ((router.mMapTable[{"TCP", 1}].nBoxPort), 7);
+    EXPECT_EQ(core.Pass(router, "1>2 3"), "1/tcp unrecorded, 3/tcp unrecorded | 1>7 | 1>7");
+    EXPECT_TRUE(WhyOf(core.First()).starts_with("it still leads to port 7 of 192.168.1.5, as before: "));
+    EXPECT_TRUE(WhyOf(core.result.rgOutcomes[1].verdict).starts_with("this box cannot note down"));
 }
 
 // What was made before there was a record is on it in memory alone, while the disk is full.
 TEST(Mapping, WhatIsKnownInMemoryAloneIsNotAskedForAgain) {
     for (const uint32_t nLease : {0U, 3600U}) {
-        MemoryRouter router;
+        MemoryRouter router("1");
         Core core;
         core.blDiskFull = true;
-        router.Put(Entry(1, 1, kBox, "tavo:a")).nLease = nLease;
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1"});
+        router.mMapTable[{"TCP", 1}].nLease = nLease;
+        EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 | 1 | 1");
         router.mMapTable.clear();
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp unrecorded"});
-        EXPECT_TRUE(router.mMapTable.empty());
+        EXPECT_TRUE(core.Pass(router, "1").starts_with("1/tcp unrecorded |  |"));
         core.blDiskFull = false;
-        EXPECT_EQ(Texts(core.Run(router, {Entry(1, 1, "", "tavo:a")})), Rows{"1/tcp 1 anew"});
+        EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 anew | 1 | 1");
     }
 }
 
 // Each look takes a second, and a pass has a hundred and fifty: the next one goes on where it ended, and what is not
 // reached yet is unknown, at a router that answers.
 TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
-    class Slow : public MemoryRouter {
-    public:
-        explicit Slow(int64_t& nNow) : mNNow(nNow) { mNListCode = 401; }
-        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
-            ++mNNow;
-            return MemoryRouter::Get(szProtocol, nPort, mapping);
-        }
-
-    private:
-        int64_t& mNNow;
-    };
     Core core;
-    Slow router(core.nNow);
-    const std::vector<RouterMapping> rgWanted = Wanted(300);
+    MemoryRouter router;
+    router.mNListCode = 401;
+    router.mFnGet = [&core](uint16_t) {
+        ++core.nNow;
+        return std::nullopt;
+    };
     for (int i = 0; i < 12; ++i) {
         const int64_t nStart = core.nNow;
-        const auto result = core.Run(router, rgWanted);
+        const auto result = core.Run(router, Wanted(300));
         EXPECT_EQ(core.nNow - nStart, 151);
-        ASSERT_EQ(result.rgOutcomes.size(), rgWanted.size());
+        ASSERT_EQ(result.rgOutcomes.size(), 300U);
         EXPECT_TRUE(result.blUnfinished);
         EXPECT_TRUE(result.transport.IsOk()) << "slow is not silent";
         EXPECT_EQ(result.nNextSeconds, 10);
@@ -893,46 +798,34 @@ TEST(Mapping, APassThatIsTooShortIsGoneOnWith) {
             EXPECT_EQ(outcome.verdict.szWord, outcome.verdict.enState == tavo::PortState::kOpen ? "1" : "timeout");
         }
     }
-    EXPECT_EQ(router.mMapTable.size(), rgWanted.size());
+    EXPECT_EQ(router.mMapTable.size(), 300U);
 }
 
 // Of a router that takes its time: how many are looked at before the first is asked for, and how long a yes is left
 // open.
 TEST(Mapping, LooksAndYesesAreOfAFewSeconds) {
-    struct Slow : MemoryRouter {
-        RouterReply Get(const std::string& szProtocol, uint16_t nPort, RouterMapping& mapping) override {
-            Confirm(nPort);
-            nLooks += setOpen.empty() && nFirstLooks == 0 ? 1 : 0;
-            nNow += nLookSeconds;
-            return MemoryRouter::Get(szProtocol, nPort, mapping);
-        }
-        RouterReply Add(RouterMapping& mapping) override {
-            nFirstLooks = nFirstLooks == 0 ? nLooks : nFirstLooks;
-            nNow += 1 - nLookSeconds;
-            setOpen.emplace(nNow, mapping.nRouterPort);
-            return MemoryRouter::Add(mapping);
-        }
-        void Confirm(uint16_t nPort) {
-            std::erase_if(setOpen, [&](const auto& open) {
-                nLongest = open.second == nPort ? std::max(nLongest, nNow - open.first) : nLongest;
-                return open.second == nPort;
-            });
-        }
-        explicit Slow(int64_t& nCoresNow) : nNow(nCoresNow) {}
-        int64_t& nNow;
-        int nLookSeconds = 1;
-        int nLooks = 0;
-        int nFirstLooks = 0;
-        int64_t nLongest = 0;
-        std::set<std::pair<int64_t, uint16_t>> setOpen;
-    };
     for (const int nLookSeconds : {0, 1}) {
         Core core;
-        Slow router(core.nNow);
-        router.nLookSeconds = nLookSeconds;
+        MemoryRouter router;
+        int nFirstLooks = 0;
+        int64_t nLongest = 0;
+        std::map<uint16_t, int64_t> mapOpen;  // since when
+        router.mFnGet = [&](uint16_t nPort) {
+            nFirstLooks += router.mMapTable.empty() ? 1 : 0;
+            if (const auto open = mapOpen.extract(nPort)) {
+                nLongest = std::max(nLongest, core.nNow - open.mapped());
+            }
+            core.nNow += nLookSeconds;
+            return std::nullopt;
+        };
+        router.mFnAdd = [&](const RouterMapping& mapping) {
+            core.nNow += 1 - nLookSeconds;
+            mapOpen.emplace(mapping.nRouterPort, core.nNow);
+            return std::nullopt;
+        };
         core.Run(router, Wanted(70));
-        EXPECT_EQ(router.nFirstLooks, nLookSeconds == 0 ? 70 : 21);
-        EXPECT_TRUE(nLookSeconds != 0 || router.nLongest == 20) << router.nLongest;
+        EXPECT_EQ(nFirstLooks, nLookSeconds == 0 ? 70 : 21);
+        EXPECT_TRUE(nLookSeconds != 0 || nLongest == 20) << nLongest;
     }
 }
 
@@ -953,50 +846,43 @@ TEST(Mapping, WhatFailsIsTriedAgainAfterAWhile) {
     MemoryRouter router;
     Core core;
     core.blDiskFull = true;
-    auto result = core.Run(router, Wanted(1));
-    EXPECT_EQ(result.nNextSeconds, 60);
-    EXPECT_EQ(result.rgOutcomes[0].verdict.szWord, tavo::kUnrecorded);
-    EXPECT_TRUE(router.mMapTable.empty() && core.record.Here().empty());
+    EXPECT_EQ(core.Pass(router, "1"), "1/tcp unrecorded |  | ");
+    EXPECT_EQ(core.result.nNextSeconds, 60);
     core.blDiskFull = false;
-    EXPECT_EQ(core.Run(router, Wanted(1)).nNextSeconds, 1800);
+    core.Pass(router, "1");
+    EXPECT_EQ(core.result.nNextSeconds, 1800);
     core.nNow += 1800;
     router.mNAddCode = 606;
-    result = core.Run(router, Wanted(1));
-    EXPECT_EQ(result.nNextSeconds, 60);
-    EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 1"}) << "its lease runs on";
+    EXPECT_EQ(core.Pass(router, "1"), "1/tcp 1 | 1 | 1") << "its lease runs on";
+    EXPECT_EQ(core.result.nNextSeconds, 60);
 
     MemoryRouter silent;
     silent.mNListCode = silent.mNGetCode = silent.mNAddCode = tavo::kWireTimeout;
-    EXPECT_FALSE(Core().Run(silent, Wanted(9)).transport.IsOk());
+    EXPECT_FALSE(core.Run(silent, Wanted(9), "another").transport.IsOk());
     EXPECT_EQ(silent.mNCalls, 2);
 
     for (const size_t nText : {size_t{64}, size_t{65}}) {
-        MemoryRouter taken;
-        taken.Put(Entry(1, 1, "192.168.1.9", std::string(nText, 'x').c_str()));
-        EXPECT_EQ(Core().Run(taken, Wanted(1)).rgOutcomes[0].verdict.holder->szDescription, std::string(64, 'x'));
+        MemoryRouter taken("1@9=" + std::string(nText, 'x'));
+        EXPECT_EQ(Told(Core().Run(taken, Wanted(1))), "1/tcp 718 192.168.1.9 " + std::string(64, 'x'));
     }
 }
 
 TEST(Mapping, AShortLeaseIsRenewedEveryFiveSecondsAndSaidToBeShort) {
-    struct Short : MemoryRouter {
-        RouterReply Add(RouterMapping& mapping) override {
-            const RouterReply reply = MemoryRouter::Add(mapping);
-            mMapTable[tavo::KeyOf(mapping)].nLease = nLease;
-            return reply;
-        }
-        uint32_t nLease = 0;
-    };
     for (const auto& [nLease, nNext, blShort] : {std::tuple(1U, 5, true),
                                                  {9U, 5, true},
                                                  {10U, 5, false},
                                                  {12U, 6, false},
                                                  {3600U, 1800, false},
                                                  {0U, 0, false}}) {
-        Short router;
-        router.nLease = nLease;
-        const auto result = Core().Run(router, Wanted(1));
-        EXPECT_EQ(result.nNextSeconds, nNext) << nLease;
-        EXPECT_EQ(!result.rgOutcomes[0].verdict.szWhy.empty(), blShort) << nLease;
+        MemoryRouter router;
+        router.mFnAdd = [&, nLease = nLease](const RouterMapping& mapping) {
+            router.Put(mapping).nLease = nLease;
+            return RouterReply{};
+        };
+        Core core;
+        core.Pass(router, "1");
+        EXPECT_EQ(core.result.nNextSeconds, nNext) << nLease;
+        EXPECT_EQ(!core.First().szWhy.empty(), blShort) << nLease;
     }
 }
 
@@ -1004,34 +890,25 @@ TEST(Mapping, AShortLeaseIsRenewedEveryFiveSecondsAndSaidToBeShort) {
 TEST(Mapping, ALeaseThatIsOverIsNotWaitedFor) {
     for (const auto& [nAge, nNext, nLeft] :
          {std::tuple(7200, 0, 0U), {3661, 0, 0U}, {3660, 5, 0U}, {3600, 5, 1U}, {3590, 11, 10U}}) {
-        MemoryRouter router;
+        MemoryRouter router("1@4=upnp");
         Core core;
         core.nNow = 10000;
-        router.Put(Entry(1, 1, "192.168.1.4", "upnp"));
         router.mNRemoveCode = 606;
-        core.record.TurnTo({"192.168.1.1", ""});
-        core.record.Here()[{"TCP", 1}] = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - nAge};
-        const auto result = core.Run(router, {Entry(1, 1, "", "tavo:a")});
-        EXPECT_EQ(Texts(result), std::vector<std::string>{"1/tcp 606"});
-        EXPECT_EQ(std::pair(result.nNextSeconds, result.rgOutcomes[0].verdict.nLease), std::pair(nNext, nLeft)) << nAge;
+        core.Known() = {"192.168.1.4", 1, "upnp", true, 3600, core.nNow - nAge};
+        EXPECT_EQ(core.Pass(router, "1"), "1/tcp 606 | 1@4 | 1@4");
+        EXPECT_EQ(std::pair(core.result.nNextSeconds, core.First().nLease), std::pair(nNext, nLeft)) << nAge;
     }
 }
 
 // Where nothing can be seen, what is taken away blindly is only what must still be ours.
 TEST(Mapping, ABlindRemovalEndsWithTheLease) {
     for (const int nAge : {3600, 3661}) {
-        MemoryRouter router;
+        MemoryRouter router("1@9=theirs");
+        router.mNListCode = router.mNGetCode = 401;
         Core core;
-        router.mBlListNothing = true;
-        router.mNListCode = 401;
-        router.mNGetCode = 401;
-        router.mMapTable[{"TCP", 1}] = Entry(1, 1, "192.168.1.9", "theirs");
         core.nNow = 10000;
-        core.record.TurnTo({"192.168.1.1", ""});
-        core.record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", true, 3600, core.nNow - nAge};
-        core.Run(router, {});
-        EXPECT_EQ(router.mMapTable.size(), nAge == 3600 ? 0U : 1U);
-        EXPECT_TRUE(core.record.Here().empty());
+        core.Known() = {kBox, 1, "tavo:a", true, 3600, core.nNow - nAge};
+        EXPECT_EQ(core.Pass(router, ""), nAge == 3600 ? " |  | " : " | 1@9 | ");
     }
 }
 
@@ -1039,6 +916,7 @@ TEST(Mapping, ABlindRemovalEndsWithTheLease) {
 // gives the next one.
 class LendingRouter : public MemoryRouter {
 public:
+    using MemoryRouter::MemoryRouter;
     tavo::Abilities What() const override { return {false, true, true}; }
     RouterReply List(std::vector<RouterMapping>&) override { return {}; }
     RouterReply Add(RouterMapping& mapping) override {
@@ -1069,22 +947,13 @@ public:
         }
         return {};
     }
-    // Router ports, with where they lead to.
-    std::string Table() const {
-        std::string szTable;
-        for (const auto& [key, mapping] : mMapTable) {
-            szTable += std::to_string(key.second) + "-" + mapping.szClient.substr(10) + ":" +
-                       std::to_string(mapping.nBoxPort) + " ";
-        }
-        return szTable;
-    }
 
     std::string mSzClient = kBox;
     bool mBlLoseAdd = false;  // the answer to the next one
     bool mBlLoseRemove = false;
 
 private:
-    std::map<std::pair<std::string, uint16_t>, RouterMapping>::iterator Find(const RouterMapping& mapping) {
+    std::map<tavo::MappingKey, RouterMapping>::iterator Find(const RouterMapping& mapping) {
         return std::find_if(mMapTable.begin(), mMapTable.end(), [&](const auto& row) {
             return row.second.szClient == mapping.szClient && row.second.nBoxPort == mapping.nBoxPort;
         });
@@ -1093,39 +962,31 @@ private:
 
 // Two routers at one address: where the one had another place to give, the other has lent the place that was asked for.
 TEST(Mapping, WhatOneRouterGaveElsewhereSaysNothingOfAnother) {
-    LendingRouter first;
+    LendingRouter first("6>1@9");
     LendingRouter other;
-    first.Put(Entry(6, 1, "192.168.1.9", "game"));
     Core core;
-    const std::vector<RouterMapping> rgWanted = {Entry(6, 3, "", "tavo:a")};
-    EXPECT_EQ(Texts(core.Run(other, rgWanted, "bb")), Rows{"6/tcp 1 anew"});
-    EXPECT_EQ(Texts(core.Run(first, rgWanted, "aa")), Rows{"6/tcp offered 7"});
+    EXPECT_EQ(core.Pass(other, "6>3", "bb"), "6/tcp 1 anew | 6>3 | 6>3");
+    EXPECT_EQ(core.Pass(first, "6>3", "aa"), "6/tcp offered 7 | 6>1@9 | ");
     core.nSaves = 0;
-    EXPECT_EQ(Texts(core.Run(first, rgWanted, "aa")), Rows{"6/tcp offered 7"});
+    EXPECT_EQ(core.Pass(first, "6>3", "aa"), "6/tcp offered 7 | 6>1@9 | ");
     EXPECT_EQ(core.nSaves, 2) << "nothing is asked for, and nothing put on record";
     core.nNow += core.habit.nLease / 2;
-    EXPECT_EQ(Texts(core.Run(other, rgWanted, "bb")), Rows{"6/tcp 1"});
-    EXPECT_EQ(Texts(core.Run(other, {Entry(9, 4, "", "tavo:b")}, "bb")), Rows{"9/tcp 1 anew"});
-    EXPECT_EQ(other.Table(), "9-5:4 ");
+    EXPECT_EQ(core.Pass(other, "6>3", "bb"), "6/tcp 1 | 6>3 | 6>3");
+    EXPECT_EQ(core.Pass(other, "9>4", "bb"), "9/tcp 1 anew | 9>4 | 9>4");
 }
 
 // A place that was once given elsewhere, and by now was given instead of another one.
 TEST(Mapping, WhatWasGrantedSinceIsRenewed) {
-    LendingRouter router;
-    router.Put(Entry(5, 1, "192.168.1.9", "game"));
-    router.Put(Entry(6, 1, "192.168.1.9", "game"));
+    LendingRouter router("5>1@9 6>1@9");
     Core core;
-    const std::vector<RouterMapping> rgWanted = {Entry(6, 3, "", "tavo:a")};
-    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp offered 7"});
+    EXPECT_EQ(core.Pass(router, "6>3"), "6/tcp offered 7 | 5>1@9 6>1@9 | ");
     router.mMapTable.erase({"TCP", 6});
     router.mBlLoseRemove = true;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(5, 3, "", "tavo:b")})),
-              (Rows{"5/tcp offered 6", "6/tcp timeout left over"}));
-    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp 1"});
+    EXPECT_EQ(core.Pass(router, "5>3"), "5/tcp offered 6, 6/tcp timeout left over | 5>1@9 6>3 | 6>3");
+    EXPECT_EQ(core.Pass(router, "6>3"), "6/tcp 1 | 5>1@9 6>3 | 6>3");
     core.nNow += core.habit.nLease / 2;
-    EXPECT_EQ(Texts(core.Run(router, rgWanted)), Rows{"6/tcp 1"});
-    core.Run(router, {});
-    EXPECT_EQ(router.Table(), "5-9:1 ");
+    EXPECT_EQ(core.Pass(router, "6>3"), "6/tcp 1 | 5>1@9 6>3 | 6>3");
+    EXPECT_EQ(core.Pass(router, ""), " | 5>1@9 | ");
 }
 
 // An answer was lost, and the place is to lead elsewhere by now: what may be there is known until it is gone.
@@ -1133,48 +994,34 @@ TEST(Mapping, WhatMayHaveBeenLentIsTakenAwayBeforeItsPlaceIsUsedAnew) {
     LendingRouter router;
     router.mBlLoseAdd = true;
     Core core;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(6, 3, "", "tavo:a")})), Rows{"6/tcp timeout"});
-    EXPECT_EQ(Texts(core.Run(router, {Entry(6, 4, "", "tavo:a")})), Rows{"6/tcp 1 anew"});
-    EXPECT_EQ(router.Table(), "6-5:4 ");
+    EXPECT_EQ(core.Pass(router, "6>3"), "6/tcp timeout | 6>3 | 6>3");
+    EXPECT_EQ(core.Pass(router, "6>4"), "6/tcp 1 anew | 6>4 | 6>4");
 
     router.mBlLoseAdd = true;
-    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:a")})), Rows{"7/tcp timeout"});
+    EXPECT_EQ(core.Pass(router, "7>3"), "7/tcp timeout | 7>3 | 7>3");
     core.szBox = router.mSzClient = "192.168.1.6";
-    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:a")})), Rows{"7/tcp former"});
-    EXPECT_EQ(Texts(core.Run(router, {})), Rows{"7/tcp former left over"});
-    EXPECT_EQ(router.Table(), "7-5:3 ");
+    EXPECT_EQ(core.Pass(router, "7>3"), "7/tcp former | 7>3 | 7>3");
+    EXPECT_EQ(core.Pass(router, ""), "7/tcp former left over | 7>3 | 7>3");
 }
 
 // It knows a mapping by the port of the box: one place for each, and the older one first has to go.
 TEST(Mapping, APortOfTheBoxIsLentAtOnePlaceOnly) {
     LendingRouter router;
     Core core;
-    auto result = core.Run(router, {Entry(6, 3, "", "tavo:a"), Entry(7, 3, "", "tavo:b")});
-    EXPECT_EQ(WhyOf(result.rgOutcomes[1].verdict),
+    EXPECT_TRUE(core.Pass(router, "6>3 7>3").ends_with(" | 6>3 | 6>3"));
+    EXPECT_EQ(WhyOf(core.result.rgOutcomes[1].verdict),
               "another rule has this port of the box; the router gives it one router port only");
-    EXPECT_EQ(router.Table(), "6-5:3 ");
     router.mBlLoseRemove = true;
-    result = core.Run(router, {Entry(7, 3, "", "tavo:b"), Entry(8, 4, "", "tavo:c")});
-    EXPECT_EQ(Texts(result),
-              (Rows{"7/tcp the router has not closed port 6 yet", "8/tcp 1 anew", "6/tcp timeout left over"}));
-    EXPECT_EQ(result.rgOutcomes[0].verdict.enState, tavo::PortState::kWaiting);
-    EXPECT_EQ(result.nNextSeconds, 10);
-    EXPECT_EQ(Texts(core.Run(router, {Entry(7, 3, "", "tavo:b")})), Rows{"7/tcp 1 anew"});
-    EXPECT_EQ(router.Table(), "7-5:3 ");
+    core.Pass(router, "7>3 8>4");
+    EXPECT_EQ(Told(core.result), "7/tcp the router has not closed port 6 yet, 8/tcp 1 anew, 6/tcp timeout left over");
+    EXPECT_EQ(core.First().enState, tavo::PortState::kWaiting);
+    EXPECT_EQ(core.result.nNextSeconds, 10);
+    EXPECT_EQ(core.Pass(router, "7>3"), "7/tcp 1 anew | 7>3 | 7>3");
 }
 
 // Routers of the first generation take no lease: some say so, and some call it bad arguments, as other things too.
 TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
     using tavo::Reply;
-    struct Scripted : MemoryRouter {
-        RouterReply Add(RouterMapping& mapping) override {
-            rgLeases.push_back(mapping.nLease);
-            mapping.nRouterPort = 9;  // only what is said last counts
-            return {rgReplies.at(rgLeases.size() - 1)};
-        }
-        std::vector<Reply> rgReplies;
-        std::vector<uint32_t> rgLeases;
-    };
     using Leases = std::vector<uint32_t>;
     for (const auto& [blKnown, rgReplies, rgLeases, blPermanentOnly] :
          {std::tuple(false, std::vector{Reply::kOk}, Leases{3600}, false),
@@ -1184,21 +1031,54 @@ TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
           {false, {Reply::kBadArguments, Reply::kBadArguments}, {3600, 0}, false},
           {false, {Reply::kConflict}, {3600}, false},
           {true, {Reply::kBadArguments}, {0}, true}}) {
-        Scripted router;
-        router.rgReplies = rgReplies;
+        MemoryRouter router;
+        Leases rgAsked;
+        router.mFnAdd = [&rgAsked, &rgReplies = rgReplies](RouterMapping& mapping) {
+            rgAsked.push_back(mapping.nLease);
+            mapping.nRouterPort = 9;  // only what is said last counts
+            return RouterReply{rgReplies.at(rgAsked.size() - 1)};
+        };
         tavo::Habits habit{.blPermanentOnly = blKnown};
         RouterMapping mapping = Entry(1, 1, kBox, "tavo:a");
         EXPECT_EQ(AddWithLease(router, mapping, habit).enReply, rgReplies.back());
-        EXPECT_EQ(router.rgLeases, rgLeases);
+        EXPECT_EQ(rgAsked, rgLeases);
         EXPECT_EQ(std::pair(mapping.nLease, mapping.nRouterPort), std::pair(rgLeases.back(), uint16_t{9}));
         EXPECT_EQ(habit.blPermanentOnly, blPermanentOnly);
+        if (rgReplies == std::vector{Reply::kOnlyPermanent, Reply::kTimeout}) {
+            rgAsked.clear();
+            Core core;
+            core.Pass(router, "1");
+            EXPECT_EQ(core.record.Here().at({"TCP", 1}).nLease, 0U) << "what may be there never ends by itself";
+        }
     }
-    // What may be there without a lease never ends by itself.
-    Scripted router;
-    router.rgReplies = {Reply::kOnlyPermanent, Reply::kTimeout};
-    Core core;
-    core.Run(router, {Entry(1, 1, "", "tavo:a")});
-    EXPECT_EQ(core.record.Here().at({"TCP", 1}).nLease, 0U);
+}
+
+// Some do not say what they refuse. One question more tells, once a router.
+TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
+    for (const bool blAll : {false, true}) {
+        MemoryRouter router;
+        int nAdds = 0;
+        router.mFnAdd = [&, blAll](const RouterMapping& mapping) {
+            ++nAdds;
+            return blAll || mapping.nLease != 0 ? std::optional(IgdReply(501)) : std::nullopt;
+        };
+        EXPECT_EQ(Told(Core().Run(router, Wanted(2))), blAll ? "1/tcp 501, 2/tcp 501" : "1/tcp 1 anew, 2/tcp 1 anew");
+        EXPECT_EQ(nAdds, 3);
+    }
+}
+
+TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
+    for (const auto& [szOther, blLease] : {std::pair("bb", true), {"aa", false}, {"", false}}) {
+        Core core;
+        MemoryRouter old;
+        old.mFnAdd = [](const RouterMapping& mapping) {
+            return mapping.nLease != 0 ? std::optional(IgdReply(tavo::kIgdOnlyPermanentLeases)) : std::nullopt;
+        };
+        core.Pass(old, "1", "aa");
+        MemoryRouter other;
+        core.Pass(other, "1", szOther);
+        EXPECT_EQ((other.mMapTable.at({"TCP", 1}).nLease != 0), blLease) << szOther;
+    }
 }
 
 // Of a router that has restarted, of one that is doubtful, and with time.
@@ -1465,23 +1345,6 @@ TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
         EXPECT_EQ(Texts(core.Run(router, Wanted(4))), one.rgszEnd) << &one - rgCases;
         EXPECT_EQ(router.nAdds, one.nAdds) << &one - rgCases;
         EXPECT_EQ(core.habit.blPermanentOnly, one.blPermanent) << &one - rgCases;
-    }
-}
-
-TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
-    class Old : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
-            return mapping.nLease != 0 ? IgdReply(tavo::kIgdOnlyPermanentLeases) : MemoryRouter::Add(mapping);
-        }
-    };
-    for (const auto& [szOther, blLease] : {std::pair("bb", true), {"aa", false}, {"", false}}) {
-        Core core;
-        Old old;
-        core.Run(old, Wanted(1), "aa");
-        MemoryRouter other;
-        core.Run(other, Wanted(1), szOther);
-        EXPECT_EQ((other.mMapTable.at({"TCP", 1}).nLease != 0), blLease) << szOther;
     }
 }
 
