@@ -130,43 +130,36 @@ TEST_F(Detection, CacheHoldsOneGatewayAndItsReaderSaysWhatItLacks) {
 
 TEST_F(Detection, UpnpVerdicts) {
     std::filesystem::create_directories("/etc.defaults/portforward/routerdb/x");
-    const struct {
-        const char* szWhat;
-        int nInit;
-        std::optional<TAVO_UPNP_GATEWAY_MODEL> model;
-        bool blResult;
-        const char* szSupport;
-        const char* szPfPath;
-        int nUpdates;
-        const char* szLine;
-    } rgCases[] = {
-        {"known model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"}, true, "yes", "Acme: R1(1.0)", 0, ""},
-        {"no router", 1, {}, true, "no", "", 0, "init UPnP faild"},
-        {"no model", 0, {}, true, "no", "", 0, ""},
-        {"brand for all models", 0, TAVO_UPNP_GATEWAY_MODEL{"AirPort", "x", "y"}, true, "yes", "", 0, ""},
-        {"unknown model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R2", "1.0"}, true, "unknown", "", 0, ""},
-        {"no name at all", 0, TAVO_UPNP_GATEWAY_MODEL{}, false, "no", "", 0, "query router upnp db failed"},
-        {"path out of the database", 0, TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}, true, "yes", "", 1,
-         "pfPath does not exist"},
-    };
+    const std::tuple<const char*, int, std::optional<TAVO_UPNP_GATEWAY_MODEL>, bool, const char*, const char*, int,
+                     const char*>
+        rgCases[] = {
+            {"known model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R1", "1.0"}, true, "yes", "Acme: R1(1.0)", 0, ""},
+            {"no router", 1, {}, true, "no", "", 0, "init UPnP faild"},
+            {"no model", 0, {}, true, "no", "", 0, ""},
+            {"brand for all models", 0, TAVO_UPNP_GATEWAY_MODEL{"AirPort", "x", "y"}, true, "yes", "", 0, ""},
+            {"unknown model", 0, TAVO_UPNP_GATEWAY_MODEL{"Acme", "R2", "1.0"}, true, "unknown", "", 0, ""},
+            {"no name at all", 0, TAVO_UPNP_GATEWAY_MODEL{}, false, "no", "", 0, "query router upnp db failed"},
+            {"path out of the database", 0, TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}, true, "yes", "", 1,
+             "pfPath does not exist"},
+        };
     Write("/etc.defaults/etc/x/router.des", "");
-    for (const auto& upnpCase : rgCases) {
-        SCOPED_TRACE(upnpCase.szWhat);
+    for (const auto& [szWhat, nInit, model, blResult, szSupport, szPfPath, nUpdates, szLine] : rgCases) {
+        SCOPED_TRACE(szWhat);
         mNetwork = Network();
-        mNetwork.nUpnpInit = upnpCase.nInit;
-        mNetwork.model = upnpCase.model;
+        mNetwork.nUpnpInit = nInit;
+        mNetwork.model = model;
         gLog.clear();
         UpnpDetector detector;
-        EXPECT_EQ(detector.Start(), upnpCase.blResult);
+        EXPECT_EQ(detector.Start(), blResult);
         EXPECT_EQ(mNetwork.nUpnpPort, 55002);
-        EXPECT_EQ(detector.GetSupportUpnp(), upnpCase.szSupport);
-        EXPECT_EQ(detector.GetPfPath(), upnpCase.szPfPath);
-        EXPECT_EQ(detector.IsAbleToGetBrandModelVersion(), upnpCase.model.has_value());
-        EXPECT_EQ(detector.GetBrand(), upnpCase.model ? upnpCase.model->szBrand : "");
-        EXPECT_EQ(mNetwork.nRouterDbUpdates, upnpCase.nUpdates);
-        EXPECT_TRUE(*upnpCase.szLine == '\0' || Logged(upnpCase.szLine));
+        EXPECT_EQ(detector.GetSupportUpnp(), szSupport);
+        EXPECT_EQ(detector.GetPfPath(), szPfPath);
+        EXPECT_EQ(detector.IsAbleToGetBrandModelVersion(), model.has_value());
+        EXPECT_EQ(detector.GetBrand(), model ? model->szBrand : "");
+        EXPECT_EQ(mNetwork.nRouterDbUpdates, nUpdates);
+        EXPECT_TRUE(*szLine == '\0' || Logged(szLine));
         EXPECT_TRUE(IsLockFree("/tmp/upnp_detector.lock"));
-        EXPECT_EQ(Read("/etc/tavoinfo.conf") == "runupnpportmapping=\"no\"\n", upnpCase.nInit == 1);
+        EXPECT_EQ(Read("/etc/tavoinfo.conf") == "runupnpportmapping=\"no\"\n", nInit == 1);
         std::filesystem::remove("/etc/tavoinfo.conf");
     }
 }
@@ -318,16 +311,8 @@ void NoteProgress(const DetectResult* pResult, void* pData) {
 TEST_F(Detection, DriverInEachNetwork) {
     const auto fnBadModel = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}; };
     const std::vector<int> rgAll = {10, 20, 30, 40, 70, 50, 80, 80};
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnChange;
-        size_t nSteps;  // of those; where it ends before, the last one is told twice
-        int nResult;
-        int nErr;
-        int nFlags;
-        int nMaxRule;
-        const char* szLine;
-    } rgCases[] = {
+    // nSteps: of those; where it ends before, the last one is told twice.
+    const std::tuple<const char*, std::function<void()>, size_t, int, int, int, int, const char*> rgCases[] = {
         {"all is well", [] {}, 8, 0, 0, 0, 32, "All network env checks are pass"},
         {"no interface", [this] { mNetwork.nInterface = -1; }, 2, -1, 0, 0, 0, "Network interface is not enabled"},
         {"no WAN", [this] { mNetwork.nWan = -1; }, 4, -1, 3, 0, 0, "Can not connect to WAN"},
@@ -340,28 +325,28 @@ TEST_F(Detection, DriverInEachNetwork) {
          "upnp fork error, errno=Resource temporarily unavailable"},
         {"supported, but nobody knows its maximum", fnBadModel, 8, -1, 0, 0, 0, "fillRouterDetectResult failed"},
     };
-    for (const auto& driver : rgCases) {
-        SCOPED_TRACE(driver.szWhat);
+    for (const auto& [szWhat, fnChange, nSteps, nResult, nErr, nFlags, nMaxRule, szLine] : rgCases) {
+        SCOPED_TRACE(szWhat);
         mNetwork = Network();
-        driver.fnChange();
+        fnChange();
         gLog.clear();
         ASSERT_EQ(SetDetectManualCache("192.168.1.1", "a", "b", "c"), 1);
         DetectResult result = {};
         std::vector<int> rgProgress;
-        std::vector<int> rgWanted(rgAll.begin(), rgAll.begin() + static_cast<std::ptrdiff_t>(driver.nSteps));
-        if (driver.nSteps < rgAll.size()) {
+        std::vector<int> rgWanted(rgAll.begin(), rgAll.begin() + static_cast<std::ptrdiff_t>(nSteps));
+        if (nSteps < rgAll.size()) {
             rgWanted.push_back(rgWanted.back());
         }
-        EXPECT_EQ(TLibDetectRouter(&result, &NoteProgress, &rgProgress, true), driver.nResult);
+        EXPECT_EQ(TLibDetectRouter(&result, &NoteProgress, &rgProgress, true), nResult);
         EXPECT_EQ(rgProgress, rgWanted);
-        EXPECT_EQ(result.nProgress, driver.nResult == 0 ? 100 : rgWanted.back());
-        EXPECT_EQ(result.errCode, driver.nErr);
-        EXPECT_EQ(result.nEnvFlags, driver.nFlags);
-        EXPECT_EQ(result.nMaxRule, driver.nMaxRule);
-        EXPECT_TRUE(Logged(driver.szLine));
+        EXPECT_EQ(result.nProgress, nResult == 0 ? 100 : rgWanted.back());
+        EXPECT_EQ(result.errCode, nErr);
+        EXPECT_EQ(result.nEnvFlags, nFlags);
+        EXPECT_EQ(result.nMaxRule, nMaxRule);
+        EXPECT_TRUE(Logged(szLine));
         EXPECT_EQ(Logged("Gateway setting is not correct"), mNetwork.nGateway == -1);
         EXPECT_EQ(Logged("can not get max rule, this router may not in routerdb"),
-                  std::string(driver.szLine) == "fillRouterDetectResult failed");
+                  std::string(szLine) == "fillRouterDetectResult failed");
         EXPECT_FALSE(DetectCache::IsCacheExisted());
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
     }

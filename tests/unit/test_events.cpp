@@ -224,29 +224,24 @@ TEST_F(EventsTest, ARouterThatWillNotIsLeftAloneForAWhile) {
 TEST_F(EventsTest, NewsIsWhatNamesOurTableAndWhatCountsAnew) {
     Subscribe();
     const std::string szLong = std::string(7500, 'x') + kCount;
-    struct Case {
-        const char* szWhat;
-        uint32_t nNumber;
-        const char* szBody;
-        bool blNews;
-    };
-    const Case rgCases[] = {{"how things stand", 0, kCount, false},
-                            {"the table", 1, kCount, true},
-                            {"something else", 2, kState, false},
-                            {"the address", 3, "<ExternalIPAddress>198.41.0.4</ExternalIPAddress>", true},
-                            {"a table of the second generation", 4, "<SystemUpdateID>7</SystemUpdateID>", true},
-                            {"nothing", 5, "", false},
-                            {"one was lost", 7, kState, true},
-                            {"it goes on", 8, kState, false},
-                            {"it counts anew", 0, kState, true},
-                            {"it goes on again", 1, kState, false},
-                            {"the last number", UINT32_MAX, kState, true},
-                            {"after which comes 1", 1, kState, false},
-                            {"a long one", 2, szLong.c_str(), true}};
-    for (const Case& one : rgCases) {
+    const std::tuple<const char*, uint32_t, const char*, bool> rgCases[] = {
+        {"how things stand", 0, kCount, false},
+        {"the table", 1, kCount, true},
+        {"something else", 2, kState, false},
+        {"the address", 3, "<ExternalIPAddress>198.41.0.4</ExternalIPAddress>", true},
+        {"a table of the second generation", 4, "<SystemUpdateID>7</SystemUpdateID>", true},
+        {"nothing", 5, "", false},
+        {"one was lost", 7, kState, true},
+        {"it goes on", 8, kState, false},
+        {"it counts anew", 0, kState, true},
+        {"it goes on again", 1, kState, false},
+        {"the last number", UINT32_MAX, kState, true},
+        {"after which comes 1", 1, kState, false},
+        {"a long one", 2, szLong.c_str(), true}};
+    for (const auto& [szWhat, nNumber, szBody, blNews] : rgCases) {
         std::string szAnswer;
-        EXPECT_EQ(IsNews(Notice(one.nNumber, one.szBody), &szAnswer), one.blNews) << one.szWhat;
-        EXPECT_EQ(szAnswer, kOk) << one.szWhat;
+        EXPECT_EQ(IsNews(Notice(nNumber, szBody), &szAnswer), blNews) << szWhat;
+        EXPECT_EQ(szAnswer, kOk) << szWhat;
     }
 }
 

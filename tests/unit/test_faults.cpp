@@ -106,12 +106,7 @@ TEST_F(Faults, APairThatCannotBeSetStopsTheRule) {
 
 TEST_F(Faults, ASettingThatCannotBeSetIsReportedWhereItMatters) {
     using Writer = RouterConfWriter;
-    const struct {
-        const char* szFail;
-        std::function<int(Writer&)> fnSet;
-        int nResult;
-        Lines rgszLines;
-    } rgCases[] = {
+    const std::tuple<const char*, std::function<int(Writer&)>, int, Lines> rgCases[] = {
         {"brand", [](Writer& w) { return w.SetBrandModelVersion("b", "m", "v"); }, 0, {}},
         {"max", [](Writer& w) { return w.SetMaxRule(1); }, 0, {}},
         {"pass", [](Writer& w) { return w.SetUserPass("u", "p"); }, 1, {}},
@@ -120,15 +115,15 @@ TEST_F(Faults, ASettingThatCannotBeSetIsReportedWhereItMatters) {
         {"router_type", [](Writer& w) { return w.SetSupportUpnp("unknown"); }, 1, {"set router type failed"}},
         {"router_type", [](Writer& w) { return w.SetSupportNatpmp("yes"); }, 1, {"set router type failed"}},
     };
-    for (const auto& failing : rgCases) {
+    for (const auto& [szFail, fnSet, nResult, rgszLines] : rgCases) {
         Writer writer(false);
         EXPECT_EQ(writer.Init(), 1);
         gLog.clear();
-        FailToSet(failing.szFail);
-        EXPECT_EQ(failing.fnSet(writer), failing.nResult) << failing.szFail;
-        EXPECT_LT(gStage.nWorks, 0) << failing.szFail << " was not reached";
+        FailToSet(szFail);
+        EXPECT_EQ(fnSet(writer), nResult) << szFail;
+        EXPECT_LT(gStage.nWorks, 0) << szFail << " was not reached";
         gStage = {};
-        EXPECT_EQ(gLog, failing.rgszLines) << failing.szFail;
+        EXPECT_EQ(gLog, rgszLines) << szFail;
     }
 }
 
@@ -204,35 +199,33 @@ TEST_F(Faults, WhatWasHalfWrittenGoesBesideEveryFile) {
     constexpr char kUserDb[] = "/etc/portforward/router_upnp.db.user";
     constexpr char kMadeFile[] = "/var/lib/tavo/faults_made.conf";
     const std::unique_ptr<TLIBCSzHash, decltype(&TLIBCSzHashFree)> pHash(TLIBCSzHashAlloc(1), &TLIBCSzHashFree);
-    const struct {
-        const char* szPath;
-        std::function<void()> fnUse;
-    } rgCases[] = {{kSystemConf, [] { TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr); }},
-                   {kAccount, [&] { TLIBCFileAddSection(kAccount, "192.168.1.1", pHash.get(), 0); }},
-                   {kAccount, [] { CountRules(); }},
-                   {kUserDb,
-                    [] {
-                        RouterUpnpDBUserWriter writer("a/b/c");
-                        EXPECT_TRUE(writer.SetMaxRule(1) && writer.Sync());
-                    }},
-                   {SZF_DETECT_MANUAL_CACHE.c_str(), [] { SetDetectManualCache("192.168.1.1", "b", "m", "v"); }},
-                   {kMadeFile, [&] { tavo::MadeFile made(kMadeFile); }},
-                   {kRuleConf, [] { CountRules(); }},
-                   {kRouterConf, [] { RouterConfReader reader; }}};
-    for (const auto& one : rgCases) {
-        const std::string szHalf = std::string(one.szPath) + ".aB3dE6";
-        const std::string szOwn = std::string(one.szPath) + ".Backup";
-        Write(one.szPath, kOldRules);
+    const std::pair<const char*, std::function<void()>> rgCases[] = {
+        {kSystemConf, [] { TLIBCFileSetKeyValue(kSystemConf, "k", "v", nullptr); }},
+        {kAccount, [&] { TLIBCFileAddSection(kAccount, "192.168.1.1", pHash.get(), 0); }},
+        {kAccount, [] { CountRules(); }},
+        {kUserDb,
+         [] {
+             RouterUpnpDBUserWriter writer("a/b/c");
+             EXPECT_TRUE(writer.SetMaxRule(1) && writer.Sync());
+         }},
+        {SZF_DETECT_MANUAL_CACHE.c_str(), [] { SetDetectManualCache("192.168.1.1", "b", "m", "v"); }},
+        {kMadeFile, [&] { tavo::MadeFile made(kMadeFile); }},
+        {kRuleConf, [] { CountRules(); }},
+        {kRouterConf, [] { RouterConfReader reader; }}};
+    for (const auto& [szPath, fnUse] : rgCases) {
+        const std::string szHalf = std::string(szPath) + ".aB3dE6";
+        const std::string szOwn = std::string(szPath) + ".Backup";
+        Write(szPath, kOldRules);
         Write(szHalf, kOldRules);
         Write(szOwn, kOldRules);
         for (const time_t nAhead : {0, 3600}) {
             gNClockAhead = nAhead;
-            one.fnUse();
-            EXPECT_EQ(std::filesystem::exists(szHalf), nAhead == 0) << one.szPath;
-            EXPECT_TRUE(std::filesystem::exists(szOwn)) << one.szPath;
+            fnUse();
+            EXPECT_EQ(std::filesystem::exists(szHalf), nAhead == 0) << szPath;
+            EXPECT_TRUE(std::filesystem::exists(szOwn)) << szPath;
         }
         gNClockAhead = 0;
-        std::filesystem::remove(one.szPath);
+        std::filesystem::remove(szPath);
         std::filesystem::remove(szOwn);
     }
 }
@@ -420,29 +413,26 @@ TEST_F(Faults, WhatAReportSetAsideComesBackUnlessSomebodyHasWrittenSince) {
 
 // The same answer at the first call and at the second, whatever stands there.
 TEST_F(Faults, SettingsThatCannotBeReadMakeRoomForThoseOfBefore) {
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnMake;
-        bool blCopy;
-    } rgCases[] = {{"garbage", [] { Write(kRouterConf, "garbage\n"); }, false},
-                   {"garbage and a copy", [] { Write(kRouterConf, "garbage\n"); }, true},
-                   {"nothing but a comment", [] { Write(kRouterConf, "# nothing\n"); }, false},
-                   {"nothing but a comment and a copy", [] { Write(kRouterConf, "# nothing\n"); }, true},
-                   {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }, false},
-                   {"a link to nowhere and a copy", [] { symlink("/nowhere", kRouterConf); }, true}};
-    for (const auto& one : rgCases) {
+    const std::tuple<const char*, std::function<void()>, bool> rgCases[] = {
+        {"garbage", [] { Write(kRouterConf, "garbage\n"); }, false},
+        {"garbage and a copy", [] { Write(kRouterConf, "garbage\n"); }, true},
+        {"nothing but a comment", [] { Write(kRouterConf, "# nothing\n"); }, false},
+        {"nothing but a comment and a copy", [] { Write(kRouterConf, "# nothing\n"); }, true},
+        {"a link to nowhere", [] { symlink("/nowhere", kRouterConf); }, false},
+        {"a link to nowhere and a copy", [] { symlink("/nowhere", kRouterConf); }, true}};
+    for (const auto& [szWhat, fnMake, blCopy] : rgCases) {
         SetUp();
-        one.fnMake();
-        if (one.blCopy) {
+        fnMake();
+        if (blCopy) {
             Write(std::string(kRouterConf) + ".bak", kOldSettings);
             MakeOlder(std::string(kRouterConf) + ".bak", 60);
         }
         gNClockAhead = 3600;
         for (int i = 0; i < 2; ++i) {
             const auto pConf = std::make_unique<RouterConf>();
-            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), one.blCopy ? 0 : 1) << one.szWhat;
-            EXPECT_EQ(Read(kRouterConf), one.blCopy ? kOldSettings : "") << one.szWhat;
-            EXPECT_EQ(Names(), one.blCopy ? Lines{"router.conf"} : Lines()) << one.szWhat;
+            EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), blCopy ? 0 : 1) << szWhat;
+            EXPECT_EQ(Read(kRouterConf), blCopy ? kOldSettings : "") << szWhat;
+            EXPECT_EQ(Names(), blCopy ? Lines{"router.conf"} : Lines()) << szWhat;
         }
         EXPECT_TRUE(Logged("file=/etc/portforward/router.conf has wrong format, try to unlink it"));
     }

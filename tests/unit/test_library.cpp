@@ -710,36 +710,27 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
     TLibTavoPortMapUnLock();
 }
 
-struct Capacity {
-    const char* szPages;
-    const char* szPorts;
-    int nStatus;
-    int nLimit;
-    int nLimit2;
-    const char* szLine;
-};
-
 TEST_F(Library, ManualRouterLimits) {
     const std::string szAll = "tcp=1\nudp=1\ntcp_udp=1\nchange router port=yes\n";
-    const Capacity rgCases[] = {
+    const std::tuple<const char*, const char*, int, int, int, const char*> rgCases[] = {
         {"support range=single\nmax rule=10\n", "1,2,3,5-6", 11, 10, 0, "get max range == 0"},
         {"max rule=10\n", "1,2,3,5-6", 10, 10, 0, "get bl is support page range == 0"},
         {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,3,4,5,6,7,8,9,10,11", 12, 10, 4, "exceed range max port"},
         {"max rule=0\n[PF range page]\nmax rule=4\n", "1", 10, -1, 0, "exceed max rule, unknown err, nMaxPort=0 "},
         {"max rule=10\n[PF range page]\nmax rule=4\n", "1,2,5-6", 0, 0, 0, ""},
     };
-    for (const Capacity& capacity : rgCases) {
-        MakeManual("[PF port page]\n" + szAll + capacity.szPages);
+    for (const auto& [szPages, szPorts, nStatus, nLimit, nLimit2, szLine] : rgCases) {
+        MakeManual("[PF port page]\n" + szAll + szPages);
         std::filesystem::remove(kRuleConf);
-        Rule rule = MakeRule("1", capacity.szPorts);
+        Rule rule = MakeRule("1", szPorts);
         gLog.clear();
         SaveResult result = {};
         const int nResult = TLibSaveRules("192.168.1.1", 1, &rule, true, &result, nullptr, nullptr);
-        EXPECT_EQ(nResult, capacity.nStatus == 0 ? 0 : -1) << capacity.szPages;
-        EXPECT_EQ(result.nStatus, capacity.nStatus) << capacity.szPages;
-        EXPECT_EQ(result.nLimit, capacity.nLimit);
-        EXPECT_EQ(result.nLimit2, capacity.nLimit2);
-        EXPECT_EQ(LoggedFrom(capacity.szLine), capacity.nStatus != 0) << capacity.szLine;
+        EXPECT_EQ(nResult, nStatus == 0 ? 0 : -1) << szPages;
+        EXPECT_EQ(result.nStatus, nStatus) << szPages;
+        EXPECT_EQ(result.nLimit, nLimit);
+        EXPECT_EQ(result.nLimit2, nLimit2);
+        EXPECT_EQ(LoggedFrom(szLine), nStatus != 0) << szLine;
         EXPECT_EQ(std::filesystem::exists("/tmp/ran"), nResult == 0);
         EXPECT_EQ(std::filesystem::exists(kRuleConf), nResult == 0);
     }
@@ -750,24 +741,16 @@ TEST_F(Library, SaveRefusesBadArgumentsBeforeAnyWork) {
     Rule rule = MakeRule("1", "1");
     SaveResult result = {};
     const auto fnNote = [](const SaveResult*, void*) { FAIL(); };
-    struct {
-        const char* szIP;
-        int nRules;
-        Rule* pRules;
-        SaveResult* pResult;
-        bool blCallback;
-        const char* szLine;
-    } rgCases[] = {{nullptr, -1, nullptr, nullptr, true, "szGwRouterIP is NULL"},
-                   {"x", -1, nullptr, nullptr, true, "szGwRouterIP=x is not IP format"},
-                   {"1.2.3.4", -1, nullptr, nullptr, true, "saveResult is NULL"},
-                   {"1.2.3.4", -1, nullptr, &result, true, "fail: 0 > nRules=-1"},
-                   {"1.2.3.4", 1, nullptr, &result, true, "rgRules is NULL"}};
-    for (const auto& refused : rgCases) {
+    const std::tuple<const char*, int, Rule*, SaveResult*, bool, const char*> rgCases[] = {
+        {nullptr, -1, nullptr, nullptr, true, "szGwRouterIP is NULL"},
+        {"x", -1, nullptr, nullptr, true, "szGwRouterIP=x is not IP format"},
+        {"1.2.3.4", -1, nullptr, nullptr, true, "saveResult is NULL"},
+        {"1.2.3.4", -1, nullptr, &result, true, "fail: 0 > nRules=-1"},
+        {"1.2.3.4", 1, nullptr, &result, true, "rgRules is NULL"}};
+    for (const auto& [szIP, nRules, pRules, pResult, blCallback, szLine] : rgCases) {
         gLog.clear();
-        EXPECT_EQ(TLibSaveRules(refused.szIP, refused.nRules, refused.pRules, true, refused.pResult,
-                                refused.blCallback ? +fnNote : nullptr, nullptr),
-                  -1);
-        EXPECT_EQ(gLog, std::vector<std::string>{refused.szLine});
+        EXPECT_EQ(TLibSaveRules(szIP, nRules, pRules, true, pResult, blCallback ? +fnNote : nullptr, nullptr), -1);
+        EXPECT_EQ(gLog, std::vector<std::string>{szLine});
     }
     EXPECT_FALSE(std::filesystem::exists("/etc/tavoinfo.conf"));
     ASSERT_EQ(TLibTavoPortMapLock(), 0);

@@ -1427,12 +1427,7 @@ std::string LongList(const std::string& szRest) {
 
 TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
     ASSERT_EQ(LongList("").size(), 1019U);
-    const struct {
-        std::string szRouter;
-        std::string szBox;
-        size_t nPairs;
-        bool blCut;
-    } rgCases[] = {
+    const std::tuple<std::string, std::string, size_t, bool> rgCases[] = {
         {LongList(",443"), LongList(",443"), 204, true},     // of 4433, perhaps
         {LongList(",5-9"), LongList(",5-9"), 204, true},     // of 5-9000, perhaps
         {LongList(",44,"), LongList(",44,"), 205, true},     // between two
@@ -1440,14 +1435,14 @@ TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
         {LongList(",44"), LongList(",44"), 205, false},      // a byte is left
         {LongList(",4433"), LongList(",4433"), 205, false},  // written by hand, and whole
     };
-    for (const auto& c : rgCases) {
-        const auto rgPairs = tavo::ExpandRule("tcp", c.szRouter, c.szBox);
-        ASSERT_TRUE(rgPairs) << c.szRouter;
-        EXPECT_EQ(rgPairs->size(), c.nPairs) << c.szRouter;
-        const tavo::WantedSet wanted = tavo::Expand({{"1", "tcp", c.szRouter, c.szBox}});
-        EXPECT_EQ(wanted.rgMappings.size(), c.nPairs);
-        ASSERT_EQ(wanted.rgRefused.size(), c.blCut ? 1U : 0U);
-        EXPECT_TRUE(!c.blCut || wanted.rgRefused[0].verdict.szWord == "cut");
+    for (const auto& [szRouter, szBox, nPairs, blCut] : rgCases) {
+        const auto rgPairs = tavo::ExpandRule("tcp", szRouter, szBox);
+        ASSERT_TRUE(rgPairs) << szRouter;
+        EXPECT_EQ(rgPairs->size(), nPairs) << szRouter;
+        const tavo::WantedSet wanted = tavo::Expand({{"1", "tcp", szRouter, szBox}});
+        EXPECT_EQ(wanted.rgMappings.size(), nPairs);
+        ASSERT_EQ(wanted.rgRefused.size(), blCut ? 1U : 0U);
+        EXPECT_TRUE(!blCut || wanted.rgRefused[0].verdict.szWord == "cut");
     }
 }
 

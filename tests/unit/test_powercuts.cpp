@@ -541,19 +541,16 @@ TEST_F(PowerCuts, WhatOthersWriteBesideTheKeysIsKeptAndTheKeysComeBack) {
         fnSet("runnatpmpportmapping", "yes");
         fnSet("hand", "g");
     };
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnWrite;
-        const char* szKeys;
-    } rgCases[] = {{"nobody", [] {}, "hyesno"},
-                   {"another key", [&] { fnSet("hand", "g"); }, "gyesno"},
-                   {"another key, by an editor", [&] { fnReplace("hand=\"h\"", "hand=\"g\""); }, "gyesno"},
-                   {"a new key", [&] { fnSet("more", "m"); }, "hyesno"},
-                   {"the same, word for word", [&] { fnReplace("hand", "hand"); }, "hnono"},
-                   {"the key itself", [&] { fnSet("runupnpportmapping", "no"); }, "hnono"},
-                   {"the other daemon and another key", fnOther, "gnoyes"}};
+    const std::tuple<const char*, std::function<void()>, const char*> rgCases[] = {
+        {"nobody", [] {}, "hyesno"},
+        {"another key", [&] { fnSet("hand", "g"); }, "gyesno"},
+        {"another key, by an editor", [&] { fnReplace("hand=\"h\"", "hand=\"g\""); }, "gyesno"},
+        {"a new key", [&] { fnSet("more", "m"); }, "hyesno"},
+        {"the same, word for word", [&] { fnReplace("hand", "hand"); }, "hnono"},
+        {"the key itself", [&] { fnSet("runupnpportmapping", "no"); }, "hnono"},
+        {"the other daemon and another key", fnOther, "gnoyes"}};
     SetSettings("yes");
-    for (const auto& one : rgCases) {
+    for (const auto& [szWhat, fnWrite, szKeys] : rgCases) {
         std::filesystem::remove_all("/var/lib/tavo");
         Write(kSystemConf, "hand=\"h\"\nrunupnpportmapping=\"yes\"\nrunnatpmpportmapping=\"no\"\n");
         const pid_t pid = fork();
@@ -566,9 +563,9 @@ TEST_F(PowerCuts, WhatOthersWriteBesideTheKeysIsKeptAndTheKeysComeBack) {
         ASSERT_EQ(waitpid(pid, &nStatus, 0), pid);
         ASSERT_EQ(nStatus, 0);
         ASSERT_EQ(Keys(), "hnono");
-        one.fnWrite();
-        EXPECT_EQ(TAVORunKeysMend(), 0) << one.szWhat;
-        EXPECT_EQ(Keys(), one.szKeys) << one.szWhat;
+        fnWrite();
+        EXPECT_EQ(TAVORunKeysMend(), 0) << szWhat;
+        EXPECT_EQ(Keys(), szKeys) << szWhat;
     }
 }
 

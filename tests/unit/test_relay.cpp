@@ -68,12 +68,7 @@ TEST_F(Relay, PortListsAreReadInTheirOrder) {
 }
 
 TEST_F(Relay, PortListsAreWrittenAsRuns) {
-    const struct {
-        Ports ports;
-        int nSize;
-        const char* szText;
-        const char* szLine;
-    } rgCases[] = {
+    const std::tuple<Ports, int, const char*, const char*> rgCases[] = {
         {{80, 81, 82, 90}, 1024, "80-82, 90", ""},
         {{80, 81, 82, 90}, 4, "80-", ""},
         {{5, 4, 3}, 1024, "5-3", ""},
@@ -84,12 +79,12 @@ TEST_F(Relay, PortListsAreWrittenAsRuns) {
         {{80, 0}, 1024, "kept", "TAVOPFIsValidPortNo(0) failed"},
         {{80}, 0, "kept", "Bad parameter, nOutPorts=0"},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [ports, nSize, szText, szLine] : rgCases) {
         gLog.clear();
         char szOut[1024] = "kept";
-        EXPECT_EQ(ToPorts(Host(), szOut, c.nSize, c.ports), *c.szLine == '\0' ? 0 : -1) << c.szText;
-        EXPECT_STREQ(szOut, c.szText);
-        EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
+        EXPECT_EQ(ToPorts(Host(), szOut, nSize, ports), *szLine == '\0' ? 0 : -1) << szText;
+        EXPECT_STREQ(szOut, szText);
+        EXPECT_EQ(gLog, *szLine == '\0' ? Lines{} : Lines{szLine});
     }
     EXPECT_EQ(ToPorts(Host(), nullptr, 5, {}), -1);
     EXPECT_TRUE(Logged("Bad parameter, szOutPorts is NULL"));
@@ -187,20 +182,17 @@ TEST_F(Relay, StoredRulesComeBackRenumbered) {
 }
 
 TEST_F(Relay, StoredRulesThatCannotBeRead) {
-    const struct {
-        __tag_TAVO_ROUTER_RULE rule;
-        Lines lines;
-    } rgCases[] = {
+    const std::pair<__tag_TAVO_ROUTER_RULE, Lines> rgCases[] = {
         {Stored("TCP", "1", "1", "", true), {"Bad parameter, szProtocol=TCP", "ToProtocolEnum([0]=-1) failed"}},
         {Stored("tcp", "x", "1", "", true), {"invalid port no [x]", "TLibParsePorts(x) failed"}},
         {Stored("tcp", "1", "2-", "", true), {"invalid port range [2-0]", "TLibParsePorts(2-) failed"}},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [rule, lines] : rgCases) {
         gLog.clear();
         OPERATION_RULE* pOut = nullptr;
         int nOut = 7;
-        EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, &c.rule, 1), -1);
-        EXPECT_EQ(gLog, c.lines);
+        EXPECT_EQ(CreateOperationRulesArray(Host(), &pOut, &nOut, &rule, 1), -1);
+        EXPECT_EQ(gLog, lines);
         EXPECT_EQ(pOut, nullptr);
         EXPECT_EQ(nOut, 0);
     }
@@ -307,21 +299,16 @@ struct Set : OperationRules {
 
 TEST_F(Relay, RefusedArgumentsOfAPass) {
     OPERATION_RULE rule = {};
-    const struct {
-        int nRules1;
-        OPERATION_RULE* pRules1;
-        int nRules;
-        const char* szLine;
-    } rgCases[] = {
+    const std::tuple<int, OPERATION_RULE*, int, const char*> rgCases[] = {
         {-1, &rule, 0, "Bad parameter, 0 > nOpRules1=-1"},
         {1, nullptr, 0, "Bad parameter, 0 < nOpRules1=1, but rgOpRules1 is NULL"},
         {0, nullptr, -2, "Bad parameter, 0 > nOpRules=-2"},
         {0, nullptr, 2, "Bad parameter, 0 < nOpRules=2, but rgOpRules is NULL"},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [nRules1, pRules1, nRules, szLine] : rgCases) {
         gLog.clear();
-        EXPECT_EQ(DeletePortsFromRules1(Host(), c.pRules1, c.nRules1, nullptr, c.nRules, true, nullptr, nullptr), -1);
-        EXPECT_EQ(gLog, Lines({c.szLine}));
+        EXPECT_EQ(DeletePortsFromRules1(Host(), pRules1, nRules1, nullptr, nRules, true, nullptr, nullptr), -1);
+        EXPECT_EQ(gLog, Lines({szLine}));
     }
     gLog.clear();
     EXPECT_EQ(DeletePortsFromRules1(Host(), nullptr, 0, nullptr, 0, true, nullptr, nullptr), 0);
@@ -350,12 +337,8 @@ TEST_F(Relay, AnObserverIsToldOfEachPairThatGoesAndOfWhatFails) {
         std::string mSzTold;
     };
     const UsedPorts used{{2}, {3}};
-    const struct {
-        const char* szRules;
-        const char* szOthers;  // null: the ports that other hosts hold
-        int nResult;
-        const char* szTold;
-    } rgCases[] = {
+    // szOthers: null: the ports that other hosts hold.
+    const std::tuple<const char*, const char*, int, const char*> rgCases[] = {
         {"E tcp hop 1-3>5-7", nullptr, 0, "hop 2>6 -; "},
         {"E udp hop 1-3>5-7;E all web 2,3,2>7-9", nullptr, 0, "hop 3>7 -; web 2>9 -; web 2>7 -; "},
         {"E tcp hop 1>5", nullptr, 0, ""},
@@ -364,18 +347,18 @@ TEST_F(Relay, AnObserverIsToldOfEachPairThatGoesAndOfWhatFails) {
         {"E tcp hop 1>1", "E udp web 1>1", 0, ""},
         {"E tcp hop 1-2>1-2", "E tcp web 1>2", -1, "hop 2>2 web; torn"},
         {"E tcp hop 1>1;E tcp any 1>1-2;E tcp hop 1>1", "E tcp web 1>1", -1, "hop 1>1 web; any uneven"}};
-    for (const auto& c : rgCases) {
-        const Set others(c.szOthers == nullptr ? "" : c.szOthers);
+    for (const auto& [szRules, szOthers, nResult, szTold] : rgCases) {
+        const Set others(szOthers == nullptr ? "" : szOthers);
         for (const bool blTold : {true, false}) {  // who is not told is refused all the same
             Recorder recorder;
             MergeObserver* pObserver = blTold ? &recorder : nullptr;
-            const Set mine(c.szRules);
-            EXPECT_EQ(c.szOthers == nullptr
+            const Set mine(szRules);
+            EXPECT_EQ(szOthers == nullptr
                           ? DeleteUsedPorts(Host(), mine.rgRules, mine.nRules, nullptr, 0, nullptr, used, pObserver)
                           : DeletePortsFromRules1(Host(), mine.rgRules, mine.nRules, others.rgRules, others.nRules,
                                                   true, nullptr, nullptr, pObserver),
-                      c.nResult);
-            EXPECT_EQ(recorder.mSzTold, blTold ? c.szTold : "") << c.szRules;
+                      nResult);
+            EXPECT_EQ(recorder.mSzTold, blTold ? szTold : "") << szRules;
         }
     }
 }

@@ -145,12 +145,7 @@ TEST_F(RelayRouter, WhenTheRouterIsNotAskedAndWhenThatFails) {
     const auto fnConf = [](const char* szUpnp) {
         return [=] { Write("/etc/portforward/router.conf", Conf("A", "B", szUpnp, "no")); };
     };
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnSpoil;
-        int nResult;
-        std::string szLines;
-    } rgCases[] = {
+    const std::tuple<const char*, std::function<void()>, int, std::string> rgCases[] = {
         {"no settings", [] { std::filesystem::remove("/etc/portforward/router.conf"); }, 0,
          "file=/etc/portforward/router.conf not exists"},
         {"a manual router", fnConf("no"), 0, ""},
@@ -163,13 +158,13 @@ TEST_F(RelayRouter, WhenTheRouterIsNotAskedAndWhenThatFails) {
          "Cannot initialize upnp lib, ret = 1\n\nGetUsedRouterPortList() failed"},
         {"an empty table", [this] { mHome.mappings.clear(); }, 0, ""},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [szWhat, fnSpoil, nResult, szLines] : rgCases) {
         SetUp();
         mHome.cards = Home().cards;
         mNetwork = Network();
-        c.fnSpoil();
-        EXPECT_EQ(After("5000", 0, c.nResult), "5000") << c.szWhat;
-        EXPECT_EQ(LastLines(c.szLines + "\n"), c.szLines) << c.szWhat << ", and nothing before it";
+        fnSpoil();
+        EXPECT_EQ(After("5000", 0, nResult), "5000") << szWhat;
+        EXPECT_EQ(LastLines(szLines + "\n"), szLines) << szWhat << ", and nothing before it";
     }
     gLog.clear();
     EXPECT_EQ(DeleteConflictPortsForUPnPRouter(nullptr, 0, nullptr, 0, "hop"), 0);
@@ -244,11 +239,7 @@ TEST_F(RelayRouter, PrintedRequestsAndConflicts) {
     for (int i = 0; i < 9; ++i) {
         szNine += ";80;udp";
     }
-    const struct {
-        std::string szRequest;
-        int nResult;
-        std::string szPrinted;
-    } rgCases[] = {
+    const std::tuple<std::string, int, std::string> rgCases[] = {
         {"hoplink;5000-5001,5005;tcp;;5000;udp", 0,
          "service name=hoplink\nports:5000-5001,5005 szProtocol:tcp\nports:5000 szProtocol:udp\n"
          "---- Begin to dump: before delete ----\n"
@@ -263,10 +254,10 @@ TEST_F(RelayRouter, PrintedRequestsAndConflicts) {
         {"hop;0;tcp", -1, "service name=hop\nports:0 szProtocol:tcp\nCreateOperationRulesArray(rgRules) failed\n"},
         {";;", -1, "Wrong format: ;;"},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [szRequest, nResult, szPrinted] : rgCases) {
         testing::internal::CaptureStdout();
-        EXPECT_EQ(TestFuncDeleteConflictPortsForUPnPRouter(c.szRequest.c_str()), c.nResult);
-        EXPECT_EQ(testing::internal::GetCapturedStdout(), c.szPrinted) << c.szRequest;
+        EXPECT_EQ(TestFuncDeleteConflictPortsForUPnPRouter(szRequest.c_str()), nResult);
+        EXPECT_EQ(testing::internal::GetCapturedStdout(), szPrinted) << szRequest;
     }
     EXPECT_EQ(TestFuncDeleteConflictPortsForUPnPRouter(nullptr), -1);
     for (const auto& [szRequest, nResult, szLast] :

@@ -200,21 +200,18 @@ TEST_F(Saving, EndsAtTheStepThatFails) {
 }
 
 TEST_F(Saving, WaitsFiveMinutesAndNoLonger) {
-    const struct {
-        const char* szWay;
-        bool blStillborn;
-        const char* szLine;
-    } rgWaits[] = {{"natpmp", false, "wait natpmp daemon alive time out"},
-                   {"natpmp", true, "wait natpmp daemon alive time out"},
-                   {"upnp", false, "wait upnp daemon alive time out"},
-                   {"upnp", true, "wait upnp daemon alive time out"},
-                   {"manual", false, "wait manual pf process finish time out"}};
-    for (const auto& wait : rgWaits) {
-        Reset(wait.blStillborn ? 1 : kNeverDone);
-        Router(wait.szWay);
-        gStage.blStillborn = wait.blStillborn;
+    const std::tuple<const char*, bool, const char*> rgWaits[] = {
+        {"natpmp", false, "wait natpmp daemon alive time out"},
+        {"natpmp", true, "wait natpmp daemon alive time out"},
+        {"upnp", false, "wait upnp daemon alive time out"},
+        {"upnp", true, "wait upnp daemon alive time out"},
+        {"manual", false, "wait manual pf process finish time out"}};
+    for (const auto& [szWay, blStillborn, szLine] : rgWaits) {
+        Reset(blStillborn ? 1 : kNeverDone);
+        Router(szWay);
+        gStage.blStillborn = blStillborn;
         EXPECT_EQ(Save(), -1);
-        EXPECT_EQ(gLog.back(), wait.szLine);
+        EXPECT_EQ(gLog.back(), szLine);
         EXPECT_EQ(gNSlept, 302);
     }
 }
@@ -239,14 +236,7 @@ TEST_F(Saving, FailsInADaemonThatRunsWithTheWordsOfTheWayItTook) {
 TEST_F(Saving, ReportsWhatTheRouterRefused) {
     const std::string szLong(3000, 'p');
     const std::string szDone = "upnpd checking is done\n> event 1 ";
-    const struct {
-        const char* szWay;
-        int nRules;
-        std::string szAnswer;
-        int nStatus;
-        std::string szPorts;
-        std::string szEnd;
-    } rgAnswers[] = {
+    const std::tuple<const char*, int, std::string, int, std::string, std::string> rgAnswers[] = {
         {"upnp", 3, "", 7, "\x02", "> 60\nexceed max rule"},
         {"natpmp", 3, "", 7, "\x02", "> 60\nexceed max rule"},
         {"upnp", 1, "a=1\nb=718\nc=501\nd=718\n", 8, "b, d", szDone + "2 13100022 b, d|||\nupnp port conflict"},
@@ -258,15 +248,15 @@ TEST_F(Saving, ReportsWhatTheRouterRefused) {
         {"natpmp", 1, "80 -> 81", 8, "80 -> 81", "natpmpd checking is done\nnatpmp port conflict"},
         {"natpmp", 1, szLong, 8, szLong.substr(0, 1023), "natpmpd checking is done\nnatpmp port conflict"},
     };
-    for (const auto& answer : rgAnswers) {
+    for (const auto& [szWay, nRules, szAnswer, nStatus, szPorts, szEnd] : rgAnswers) {
         Reset();
-        Router(answer.szWay);
-        Write("/var/tmp/upnp_portmap.status", answer.szAnswer);
-        Write("/var/tmp/natpmp_portmap.remap", answer.szAnswer);
-        EXPECT_EQ(Save(answer.nRules), -1);
-        EXPECT_EQ(mResult.nStatus, answer.nStatus);
-        EXPECT_EQ(std::string(mResult.szPortList), answer.szPorts);
-        EXPECT_EQ(LastLines(answer.szEnd), answer.szEnd);
+        Router(szWay);
+        Write("/var/tmp/upnp_portmap.status", szAnswer);
+        Write("/var/tmp/natpmp_portmap.remap", szAnswer);
+        EXPECT_EQ(Save(nRules), -1);
+        EXPECT_EQ(mResult.nStatus, nStatus);
+        EXPECT_EQ(std::string(mResult.szPortList), szPorts);
+        EXPECT_EQ(LastLines(szEnd), szEnd);
     }
     bool blRemap = false;
     std::string szRemap;
@@ -323,19 +313,16 @@ TEST_F(Saving, AHashWithoutMemoryKeepsWhatItHas) {
 
 TEST_F(Saving, ReadsTheVersionOfTheTool) {
     gStage.blOn = false;
-    const struct {
-        const char* szOutput;
-        int nVersion;
-    } rgOutputs[] = {{"x\\nsyntax version = 3\\nsyntax version=4\\n", 4},
-                     {"syntax version = 5", 5},
-                     {"syntax versions of rules: = 6 \\n", 6},
-                     {" syntax version=1\\nSyntax version=2\\nsyntax version 3\\n", -1},
-                     {"syntax version=99999999999999999999\\n", INT32_MAX},
-                     {"syntax version=junk\\n", 0},
-                     {"", -1}};
-    for (const auto& output : rgOutputs) {
-        WriteProgram(kTool, "printf '" + std::string(output.szOutput) + "'\nexit 3\n");
-        EXPECT_EQ(IGetCurrSyntaxVersion(), output.nVersion) << output.szOutput;
+    const std::pair<const char*, int> rgOutputs[] = {{"x\\nsyntax version = 3\\nsyntax version=4\\n", 4},
+                                                     {"syntax version = 5", 5},
+                                                     {"syntax versions of rules: = 6 \\n", 6},
+                                                     {" syntax version=1\\nSyntax version=2\\nsyntax version 3\\n", -1},
+                                                     {"syntax version=99999999999999999999\\n", INT32_MAX},
+                                                     {"syntax version=junk\\n", 0},
+                                                     {"", -1}};
+    for (const auto& [szOutput, nVersion] : rgOutputs) {
+        WriteProgram(kTool, "printf '" + std::string(szOutput) + "'\nexit 3\n");
+        EXPECT_EQ(IGetCurrSyntaxVersion(), nVersion) << szOutput;
     }
     WriteProgram(kTool, "/usr/bin/head -c 200000 /dev/zero | /usr/bin/tr '\\0' x; printf '\\nsyntax version=7\\n'\n");
     EXPECT_EQ(IGetCurrSyntaxVersion(), 7);

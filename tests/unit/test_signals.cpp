@@ -23,24 +23,21 @@ namespace {
 TEST(SignalQueue, WhatAQuestionTookInEndsTheNextWaitAndNoFurtherOne) {
     constexpr int kLongMilliseconds = 20000;
     using Question = bool (tavo::SignalQueue::*)();
-    struct Case {
-        int nSignal;
-        Question pfnAsked;  // takes the signal in, and is about another one
-        Question pfnToldAfter;
-    };
-    const Case rgCases[] = {{SIGTERM, &tavo::SignalQueue::HasRequest, &tavo::SignalQueue::IsStop},
-                            {SIGUSR1, &tavo::SignalQueue::TakeRequest, &tavo::SignalQueue::IsHandOver},
-                            {SIGHUP, &tavo::SignalQueue::IsStop, &tavo::SignalQueue::TakeRequest}};
+    // pfnAsked: takes the signal in, and is about another one.
+    const std::tuple<int, Question, Question> rgCases[] = {
+        {SIGTERM, &tavo::SignalQueue::HasRequest, &tavo::SignalQueue::IsStop},
+        {SIGUSR1, &tavo::SignalQueue::TakeRequest, &tavo::SignalQueue::IsHandOver},
+        {SIGHUP, &tavo::SignalQueue::IsStop, &tavo::SignalQueue::TakeRequest}};
     sigset_t before;
     sigprocmask(SIG_BLOCK, nullptr, &before);
-    for (const Case& one : rgCases) {
+    for (const auto& [nSignal, pfnAsked, pfnToldAfter] : rgCases) {
         tavo::SignalQueue queue;
-        raise(one.nSignal);
-        EXPECT_FALSE((queue.*one.pfnAsked)());
+        raise(nSignal);
+        EXPECT_FALSE((queue.*pfnAsked)());
         const auto start = std::chrono::steady_clock::now();
         queue.Wait(kLongMilliseconds);
         EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(kLongMilliseconds / 2));
-        EXPECT_TRUE((queue.*one.pfnToldAfter)());
+        EXPECT_TRUE((queue.*pfnToldAfter)());
         queue.Wait(0);
         pollfd waiting = queue.Waiting();
         queue.Wait({&waiting, 1}, 1);
