@@ -1,5 +1,4 @@
 // What a router tells its subscribers: how one subscribes, and what of all that comes to the ear is news.
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
@@ -13,7 +12,7 @@
 #include <utility>
 #include <vector>
 
-#include "ground/Descriptor.h"
+#include "loopback.h"
 #include "webserver.h"
 #include "wire/http/Request.h"
 #include "wire/upnp/Events.h"
@@ -89,14 +88,9 @@ protected:
         mPRouter->TakeAsked();
     }
     tavo::Descriptor Connect(const char* szFrom = kRouter) const {
-        tavo::Descriptor fd(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_in address = {};
-        address.sin_family = AF_INET;
-        inet_pton(AF_INET, szFrom, &address.sin_addr);
-        EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-        inet_pton(AF_INET, kRouter, &address.sin_addr);
-        address.sin_port = htons(mPRouter->Port());
-        EXPECT_EQ(connect(fd.Get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+        tavo::Descriptor fd = SocketAt(szFrom, 0, SOCK_STREAM);
+        const sockaddr_in router = AddressOf(kRouter, mPRouter->Port());
+        EXPECT_EQ(connect(fd.Get(), reinterpret_cast<const sockaddr*>(&router), sizeof(router)), 0);
         return fd;
     }
     static void Send(const tavo::Descriptor& fd, const std::string& szText) {
@@ -414,6 +408,14 @@ TEST(HttpUrl, IsOfOneHostAndOnePort) {
     EXPECT_FALSE(tavo::ParseHttpUrl("https://h/"));
 }
 
+using Pair = std::pair<tavo::Descriptor, tavo::Descriptor>;
+
+Pair ConnectedPair() {
+    int rgFds[2] = {};
+    EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds), 0);
+    return {tavo::Descriptor(rgFds[0]), tavo::Descriptor(rgFds[1])};
+}
+
 // Of what has come so far, and over a socket whose other side says no more.
 TEST(HttpRequest, IsWholeAndPlainOrItIsNone) {
     using tavo::HttpFault;
@@ -452,9 +454,7 @@ TEST(HttpRequest, IsWholeAndPlainOrItIsNone) {
     for (const auto& [szWhat, szText, enFault] : rgCases) {
         tavo::HttpRequest whole;
         EXPECT_EQ(whole.Parse(szText), enFault) << szWhat;
-        int rgFds[2] = {};
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds), 0);
-        const tavo::Descriptor fdHere(rgFds[0]), fdThere(rgFds[1]);
+        const auto [fdHere, fdThere] = ConnectedPair();
         send(fdThere.Get(), szText.data(), szText.size(), 0);
         shutdown(fdThere.Get(), SHUT_WR);
         tavo::BoundedSocket bounded(fdHere.Get(), -1);
@@ -475,11 +475,9 @@ TEST(HttpRequest, IsReadToABoundAndToAStop) {
     for (const auto& [szText, blStop, blRead] :
          {std::tuple(HeadOf(32767, szFirst) + "x", false, true), std::tuple(HeadOf(32768, szFirst) + "x", false, false),
           std::tuple(std::string(), true, false)}) {
-        int rgFds[2] = {};
-        int rgStop[2] = {};
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds) + pipe(rgStop), 0);
-        const tavo::Descriptor fdHere(rgFds[0]), fdThere(rgFds[1]), fdStop(rgStop[0]);
-        tavo::Descriptor fdStopper(rgStop[1]);
+        const Pair connected = ConnectedPair();
+        const tavo::Descriptor &fdHere = connected.first, &fdThere = connected.second;
+        auto [fdStop, fdStopper] = ConnectedPair();
         send(fdThere.Get(), szText.data(), szText.size() - (blRead ? 1 : 0), 0);
         if (blStop) {
             fdStopper.Reset();
@@ -506,11 +504,9 @@ TEST(HttpRequest, IsReadToABoundAndToAStop) {
 TEST(BoundedSocket, AnAnswerIsWholeOrGivenUp) {
     const std::string szAnswer(4U << 20U, 'x');
     for (const bool blReads : {true, false}) {
-        int rgFds[2] = {};
-        int rgStop[2] = {};
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, rgFds) + pipe(rgStop), 0);
-        const tavo::Descriptor fdHere(rgFds[0]), fdStop(rgStop[0]);
-        tavo::Descriptor fdThere(rgFds[1]), fdStopper(rgStop[1]);
+        Pair connected = ConnectedPair();
+        Pair stop = ConnectedPair();
+        tavo::Descriptor &fdHere = connected.first, &fdThere = connected.second, &fdStopper = stop.second;
         send(fdThere.Get(), "more", 4, 0);
         size_t nRead = 0;
         std::thread reader([&] {
@@ -521,7 +517,7 @@ TEST(BoundedSocket, AnAnswerIsWholeOrGivenUp) {
             blReads ? fdThere.Reset() : fdStopper.Reset();
         });
         const auto start = std::chrono::steady_clock::now();
-        tavo::BoundedSocket bounded(fdHere.Get(), fdStop.Get());
+        tavo::BoundedSocket bounded(fdHere.Get(), stop.first.Get());
         bounded.Write(szAnswer);
         bounded.Finish();
         EXPECT_LT(std::chrono::steady_clock::now() - start, 3s);

@@ -1,8 +1,6 @@
 // The IGD client, and what else is heard by UPnP, against hostile answers.
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/socket.h>
 
 #include <atomic>
 #include <chrono>
@@ -10,7 +8,7 @@
 #include <thread>
 #include <tuple>
 
-#include "ground/Descriptor.h"
+#include "loopback.h"
 #include "programs/common/IgdRouter.h"
 #include "tavo/core.h"
 #include "webserver.h"
@@ -595,25 +593,8 @@ protected:
     static constexpr char kGateway[] = "192.168.77.1";
     static constexpr char kBox[] = "192.168.77.5";
 
-    void SetUp() override {
-        for (const char* szAddress : {kGateway, kBox}) {
-            ASSERT_EQ(TLIBCSystem((std::string("ip address add dev lo ") + szAddress).c_str()), 0);
-        }
-        mFd = SocketAt(kGateway, 1900);
-    }
-    void TearDown() override {
-        for (const char* szAddress : {kGateway, kBox}) {
-            TLIBCSystem((std::string("ip address del dev lo ") + szAddress + "/32").c_str());
-        }
-    }
     static tavo::Descriptor SocketAt(const char* szAddress, uint16_t nPort) {
-        tavo::Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-        sockaddr_in own = {};
-        own.sin_family = AF_INET;
-        own.sin_port = htons(nPort);
-        inet_pton(AF_INET, szAddress, &own.sin_addr);
-        EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
-        return fd;
+        return ::SocketAt(szAddress, nPort, SOCK_DGRAM | SOCK_NONBLOCK);
     }
     static std::string Answer(const std::string& szPlace, const char* szHost = kGateway) {
         return std::string("HTTP/1.1 200 OK\r\nLOCATION: http://") + szHost + szPlace + "\r\n\r\n";
@@ -621,19 +602,14 @@ protected:
     // Takes the questions that are there. True when there was one.
     bool Hear() {
         char szQuestion[1000] = {};
-        socklen_t nLength = sizeof(mFrom);
         bool blHeard = false;
-        while (recvfrom(mFd.Get(), szQuestion, sizeof(szQuestion) - 1, 0, reinterpret_cast<sockaddr*>(&mFrom),
-                        &nLength) > 0) {
+        while (Receive(mFd.Get(), std::span(szQuestion).first(999), mFrom) > 0) {
             mRgszTargets.push_back(std::string(szQuestion).substr(std::string(szQuestion).find("ST: ")));
             blHeard = true;
         }
         return blHeard;
     }
-    void Say(const std::string& szText) const { Say(mFd, szText); }
-    void Say(const tavo::Descriptor& fd, const std::string& szText) const {
-        sendto(fd.Get(), szText.data(), szText.size(), 0, reinterpret_cast<const sockaddr*>(&mFrom), sizeof(mFrom));
-    }
+    void Say(const std::string& szText) const { Send(mFd.Get(), szText, mFrom); }
     // fnTurn: what the gateway does each time that the search looks whether it is to stop.
     bool Search(int nMilliseconds, const std::function<void()>& fnTurn, int nPort = 0, bool blTakes = false) {
         mRgszTried.clear();
@@ -649,7 +625,8 @@ protected:
             });
     }
 
-    tavo::Descriptor mFd;
+    LoopbackHosts mHosts{kGateway, kBox};
+    tavo::Descriptor mFd = SocketAt(kGateway, 1900);
     sockaddr_in mFrom = {};
     std::vector<std::string> mRgszTargets;
     std::vector<std::string> mRgszTried;
@@ -680,11 +657,11 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
     bool blSaid = false;
     const auto fnTalk = [&] {
         if (Hear() && !std::exchange(blSaid, true)) {
-            Say(fdNeighbour, Answer("/neighbour", kBox));
+            Send(fdNeighbour.Get(), Answer("/neighbour", kBox), mFrom);
             Say(Answer("/a"));
             Say(Answer("/a"));
             Say(Answer("/b", kBox));
-            Say(fdNeighbour, Answer("/c"));
+            Send(fdNeighbour.Get(), Answer("/c"), mFrom);
         }
     };
     EXPECT_FALSE(Search(290, fnTalk));
@@ -768,18 +745,13 @@ TEST_F(SearchTest, TheGatewaysOwnAnnouncementsAreNews) {
     EXPECT_FALSE(announcements.TakeNews(kGateway));
     announcements.Listen(kBox);
     ASSERT_GE(announcements.Fd(), 0);
-    inet_pton(AF_INET, "239.255.255.250", &mFrom.sin_addr);
-    mFrom.sin_family = AF_INET;
-    mFrom.sin_port = htons(1900);
     // The number stands at the end of a datagram of so many bytes at least.
     const auto fnSay = [&](const char* szFrom, const std::string& szBoot, size_t nBytes = 0) {
         const tavo::Descriptor fd = SocketAt(szFrom, 0);
-        in_addr own = {};
-        inet_pton(AF_INET, szFrom, &own);
-        setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &own, sizeof(own));
         const std::string szText = "NOTIFY * HTTP/1.1\r\nNTS: ssdp:alive\r\nUSN: u\r\nBOOTID.UPNP.ORG: ";
         const size_t nLength = szText.size() + szBoot.size();
-        Say(fd, szText + std::string(std::max(nBytes, nLength) - nLength, ' ') + szBoot);
+        Send(ToAll(fd, szFrom).Get(), szText + std::string(std::max(nBytes, nLength) - nLength, ' ') + szBoot,
+             AddressOf("239.255.255.250", 1900));
     };
     const std::tuple<const char*, const char*, size_t, bool> rgCases[] = {
         {kBox, "1", 0, false},    {kGateway, "1", 0, true},    {kGateway, "1", 0, false},

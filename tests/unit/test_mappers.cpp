@@ -1,8 +1,6 @@
 // The mapping sides of both daemons, each at a router on the loopback device: what they ask it for, and when anew.
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/socket.h>
 
 #include <algorithm>
 #include <atomic>
@@ -11,7 +9,7 @@
 #include <mutex>
 #include <thread>
 
-#include "ground/Descriptor.h"
+#include "loopback.h"
 #include "network.h"
 #include "programs/natpmpd/NatpmpMapper.h"
 #include "programs/upnpd/UpnpMapper.h"
@@ -31,46 +29,15 @@ constexpr char kRules[] = "/etc/portforward/rule.conf";
 constexpr char kSystem[] = "/etc/tavoinfo.conf";
 constexpr uint16_t kSsdpPort = 1900;
 
-sockaddr_in AddressOf(const char* szAddress, uint16_t nPort) {
-    sockaddr_in address = {};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(nPort);
-    inet_pton(AF_INET, szAddress, &address.sin_addr);
-    return address;
-}
-
-tavo::Descriptor SocketAt(const char* szAddress, uint16_t nPort, int nKind = SOCK_DGRAM) {
-    tavo::Descriptor fd(socket(AF_INET, nKind | SOCK_CLOEXEC, 0));
-    const sockaddr_in own = AddressOf(szAddress, nPort);
-    EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
-    return fd;
-}
-
-void Send(const tavo::Descriptor& fd, const std::string& szText, const sockaddr_in& to) {
-    EXPECT_EQ(sendto(fd.Get(), szText.data(), szText.size(), 0, reinterpret_cast<const sockaddr*>(&to), sizeof(to)),
-              static_cast<ssize_t>(szText.size()));
-}
-
 // Of the gateway's, to all that listen.
 void SayToAll(const char* szGroup, uint16_t nPort, const std::string& szText) {
-    const tavo::Descriptor fd = SocketAt(kGateway, 0);
-    const in_addr own = AddressOf(kGateway, 0).sin_addr;
-    setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &own, sizeof(own));
-    Send(fd, szText, AddressOf(szGroup, nPort));
+    const tavo::Descriptor fd = SocketAt(kGateway);
+    Send(ToAll(fd, kGateway).Get(), szText, AddressOf(szGroup, nPort));
 }
 
 class MapperTest : public testing::Test {
 protected:
-    explicit MapperTest(std::string szRunKey) : mSzRunKey(std::move(szRunKey)) {
-        for (const char* szAddress : {kGateway, kBox, kNewBox}) {
-            EXPECT_EQ(TLIBCSystem((std::string("ip address add dev lo ") + szAddress).c_str()), 0);
-        }
-    }
-    ~MapperTest() override {
-        for (const char* szAddress : {kGateway, kBox, kNewBox}) {
-            TLIBCSystem((std::string("ip address del dev lo ") + szAddress + "/32 2>/dev/null").c_str());
-        }
-    }
+    explicit MapperTest(std::string szRunKey) : mSzRunKey(std::move(szRunKey)) {}
     void SetUp() override {
         MakeEmpty({"/var/lib/tavo", "/run/tavo"});
         std::filesystem::remove("/etc/tavo/platform.conf");
@@ -103,6 +70,7 @@ protected:
         return mapper.Run(blRequested, [] { return false; });
     }
 
+    LoopbackHosts mHosts{kGateway, kBox, kNewBox};
     std::string mSzRunKey;
     Network mNetwork;
     JumpingClock mClock;
@@ -127,12 +95,10 @@ public:
 private:
     void Serve() {
         for (pollfd waiting = {mFd.Get(), POLLIN, 0}; !mBlEnd;) {
-            uint8_t rgAsked[64];
+            char rgAsked[64];
             sockaddr_in from = {};
-            socklen_t nLength = sizeof(from);
-            if (poll(&waiting, 1, 10) > 0 &&
-                recvfrom(mFd.Get(), rgAsked, sizeof(rgAsked), 0, reinterpret_cast<sockaddr*>(&from), &nLength) > 0) {
-                Send(mFd, Answer(rgAsked, from), from);
+            if (poll(&waiting, 1, 10) > 0 && Receive(mFd.Get(), rgAsked, from) > 0) {
+                Send(mFd.Get(), Answer(reinterpret_cast<const uint8_t*>(rgAsked), from), from);
             }
         }
     }
@@ -318,10 +284,7 @@ public:
             mRgLines.push_back({szPath});
         }
         EXPECT_EQ(listen(mFd.Get(), 8), 0);
-        sockaddr_in own = {};
-        socklen_t nLength = sizeof(own);
-        getsockname(mFd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength);
-        mSzPlace = std::string("http://") + kGateway + ":" + std::to_string(ntohs(own.sin_port)) + "/root.xml";
+        mSzPlace = std::string("http://") + kGateway + ":" + std::to_string(PortOf(mFd)) + "/root.xml";
         mThread = std::thread([this] { Serve(); });
     }
     ~UpnpRouter() {
@@ -500,12 +463,9 @@ TEST_F(UpnpMapping, ARouterThatAnswersLateIsFoundByThat) {
     EXPECT_EQ(Result(), "80/tcp=noigd\n");
     char szQuestion[1000];
     sockaddr_in from = {};
-    socklen_t nLength = sizeof(from);
-    ASSERT_GT(recvfrom(fdSearched.Get(), szQuestion, sizeof(szQuestion), MSG_DONTWAIT,
-                       reinterpret_cast<sockaddr*>(&from), &nLength),
-              0);
+    ASSERT_GT(Receive(fdSearched.Get(), szQuestion, from, MSG_DONTWAIT), 0);
     EXPECT_FALSE(mapper.OnWake());
-    Send(fdSearched, "HTTP/1.1 200 OK\r\nLOCATION: " + router.Place() + "\r\n\r\n", from);
+    Send(fdSearched.Get(), "HTTP/1.1 200 OK\r\nLOCATION: " + router.Place() + "\r\n\r\n", from);
     const auto rgFds = mapper.WakeFds();
     EXPECT_TRUE(std::any_of(rgFds.begin(), rgFds.end(), [](int fd) {
         pollfd waiting = {fd, POLLIN, 0};

@@ -1,8 +1,6 @@
 // NAT-PMP's datagrams, good and bad, and the exchange of them with a gateway on loopback.
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/socket.h>
 
 #include <algorithm>
 #include <atomic>
@@ -12,7 +10,7 @@
 #include <thread>
 #include <vector>
 
-#include "ground/Descriptor.h"
+#include "loopback.h"
 #include "wire/pcp/Announcements.h"
 #include "wire/pcp/Client.h"
 #include "wire/pcp/Exchange.h"
@@ -121,16 +119,6 @@ TEST(NatpmpPacket, AnnouncementsOfBothProtocols) {
     }
 }
 
-tavo::Descriptor SocketAt(const char* szAddress) {
-    tavo::Descriptor fd(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    sockaddr_in own = {};
-    own.sin_family = AF_INET;
-    own.sin_port = htons(tavo::kGatewayPort);
-    inet_pton(AF_INET, szAddress, &own.sin_addr);
-    EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), sizeof(own)), 0);
-    return fd;
-}
-
 // A gateway, and a neighbour who speaks at the same time; what they say is given for each question, by its number.
 class Peer {
 public:
@@ -146,11 +134,9 @@ public:
 private:
     void Serve() {
         for (pollfd waiting = {mFd.Get(), POLLIN, 0}; !mBlEnd;) {
-            uint8_t rgQuestion[64];
+            char rgQuestion[64];
             sockaddr_in from = {};
-            socklen_t nLength = sizeof(from);
-            if (poll(&waiting, 1, 10) <= 0 || recvfrom(mFd.Get(), rgQuestion, sizeof(rgQuestion), 0,
-                                                       reinterpret_cast<sockaddr*>(&from), &nLength) < 0) {
+            if (poll(&waiting, 1, 10) <= 0 || Receive(mFd.Get(), rgQuestion, from) < 0) {
                 continue;
             }
             const int nQuestion = ++mNQuestions;
@@ -160,12 +146,12 @@ private:
     }
     static void Say(int fd, const Says& fnSays, int nQuestion, const sockaddr_in& to) {
         for (const Bytes& rgBytes : fnSays ? fnSays(nQuestion) : std::vector<Bytes>()) {
-            sendto(fd, rgBytes.data(), rgBytes.size(), 0, reinterpret_cast<const sockaddr*>(&to), sizeof(to));
+            Send(fd, rgBytes, to);
         }
     }
 
-    tavo::Descriptor mFd = SocketAt(kGateway);
-    tavo::Descriptor mFdNeighbour = SocketAt(kNeighbour);
+    tavo::Descriptor mFd = SocketAt(kGateway, tavo::kGatewayPort);
+    tavo::Descriptor mFdNeighbour = SocketAt(kNeighbour, tavo::kGatewayPort);
     Says mFnGateway;
     Says mFnNeighbour;
     std::atomic<int> mNQuestions = 0;
@@ -199,8 +185,6 @@ TEST(NatpmpExchange, EndsAsItMustAndInTime) {
                             {"silent", fnSilent, {}, End::kSilent, 3, 1200ms, 2s},
                             {"a neighbour's word", fnSilent, fnGood, End::kSilent, 3, 1200ms, 2s},
                             {"stopped", fnSilent, {}, End::kSilent, 1, 50ms, 1s, 50ms}};
-    in_addr gateway = {};
-    inet_pton(AF_INET, kGateway, &gateway);
     const auto fnTake = [&](std::span<const uint8_t> rgRead) {
         return std::equal(rgRead.begin(), rgRead.end(), rgGood.begin(), rgGood.end());
     };
@@ -208,13 +192,15 @@ TEST(NatpmpExchange, EndsAsItMustAndInTime) {
         const Peer peer(one.fnGateway, one.fnNeighbour);
         const auto start = Clock::now();
         const auto fnStop = [&] { return Clock::now() - start > one.stop; };
-        EXPECT_EQ(tavo::Exchange({}, gateway, rgGood, 1200ms, fnTake, fnStop), one.enEnd) << one.szWhat;
+        EXPECT_EQ(tavo::Exchange({}, AddressOf(kGateway).sin_addr, rgGood, 1200ms, fnTake, fnStop), one.enEnd)
+            << one.szWhat;
         const auto took = Clock::now() - start;
         EXPECT_TRUE(took >= one.least && took < one.most) << one.szWhat << " " << took / 1ms;
         EXPECT_EQ(peer.Questions(), one.nQuestions) << one.szWhat;
     }
     const auto start = Clock::now();
-    EXPECT_EQ(tavo::Exchange({}, gateway, rgGood, 5s, fnTake, {}), End::kUnreachable) << "nobody listens";
+    EXPECT_EQ(tavo::Exchange({}, AddressOf(kGateway).sin_addr, rgGood, 5s, fnTake, {}), End::kUnreachable)
+        << "nobody listens";
     EXPECT_LT(Clock::now() - start, 1s);
 }
 
@@ -270,29 +256,21 @@ TEST(NatpmpClient, WhetherAGatewaySpeaksIt) {
 TEST(GatewayAnnouncements, AreTheGatewaysOwn) {
     tavo::GatewayAnnouncements announcements;
     ASSERT_GE(announcements.Fd(), 0);
-    sockaddr_in all = {};
-    all.sin_family = AF_INET;
-    all.sin_port = htons(5350);
-    all.sin_addr.s_addr = htonl(INADDR_ALLHOSTS_GROUP);
-    in_addr loopback = {htonl(INADDR_LOOPBACK)};
+    const sockaddr_in all = AddressOf("224.0.0.1", 5350);
     const Bytes rgStarted{0, 128, 0, 0, 0, 0, 0, 7, 198, 41, 0, 4};
     const Bytes rgGarbage{0, 128};
     for (const auto& [szFrom, rgSaid] :
          {std::pair(kNeighbour, rgStarted), {kGateway, rgGarbage}, {kGateway, rgStarted}, {kGateway, rgStarted}}) {
-        const tavo::Descriptor fd = SocketAt(szFrom);
-        setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &loopback, sizeof(loopback));
-        EXPECT_EQ(
-            sendto(fd.Get(), rgSaid.data(), rgSaid.size(), 0, reinterpret_cast<const sockaddr*>(&all), sizeof(all)),
-            static_cast<ssize_t>(rgSaid.size()));
+        const tavo::Descriptor fd = SocketAt(szFrom, tavo::kGatewayPort);
+        Send(ToAll(fd, "127.0.0.1").Get(), rgSaid, all);
     }
     const auto rgHeard = announcements.Take(kGateway);
     ASSERT_EQ(rgHeard.size(), 2U);
     EXPECT_EQ(std::pair(rgHeard[0].blPcp, rgHeard[0].nEpoch), std::pair(false, 7U));
     EXPECT_TRUE(announcements.Take(kGateway).empty());
-    const tavo::Descriptor fd = SocketAt(kGateway);
-    setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_IF, &loopback, sizeof(loopback));
+    const tavo::Descriptor fd = SocketAt(kGateway, tavo::kGatewayPort);
     for (int i = 0; i < 65; ++i) {
-        sendto(fd.Get(), rgStarted.data(), rgStarted.size(), 0, reinterpret_cast<const sockaddr*>(&all), sizeof(all));
+        Send(ToAll(fd, "127.0.0.1").Get(), rgStarted, all);
     }
     EXPECT_EQ(announcements.Take(kGateway).size(), 64U) << "of a flood, so many at once";
     EXPECT_EQ(announcements.Take(kGateway).size(), 1U);

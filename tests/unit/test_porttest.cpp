@@ -177,28 +177,17 @@ TEST(Checker, IsAskedAndItsAnswerReadOrTheReasonGiven) {
 // On loopback: who answers, who only listens, and nobody.
 TEST(Prober, SaysOfEachPortWhatCameBack) {
     struct Listener {
-        explicit Listener(int nKind) : fd(socket(AF_INET, nKind | SOCK_CLOEXEC, 0)) {
-            sockaddr_in own = {};
-            own.sin_family = AF_INET;
-            own.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-            socklen_t nLength = sizeof(own);
-            EXPECT_EQ(bind(fd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength), 0);
-            listen(fd.Get(), 1);
-            getsockname(fd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength);
-            nPort = ntohs(own.sin_port);
-        }
+        explicit Listener(int nKind) : fd(SocketAt("127.0.0.1", 0, nKind)), nPort(PortOf(fd)) { listen(fd.Get(), 1); }
         // One challenge, by whoever sends it, on a socket of its own or on this one.
         void Answer(int fdHere) const {
             char szText[64] = {};
             sockaddr_in peer = {};
-            socklen_t nLength = sizeof(peer);
-            recvfrom(fdHere, szText, sizeof(szText) - 1, 0, reinterpret_cast<sockaddr*>(&peer), &nLength);
+            Receive(fdHere, std::span(szText).first(63), peer);
             EXPECT_EQ(szText, "ask:" + std::to_string(nPort) + "\n");
-            const std::string szAnswer = "answer:" + std::to_string(nPort) + "\n";
-            sendto(fdHere, szAnswer.data(), szAnswer.size(), 0, reinterpret_cast<sockaddr*>(&peer), nLength);
+            Send(fdHere, "answer:" + std::to_string(nPort) + "\n", peer);
         }
         tavo::Descriptor fd;
-        uint16_t nPort = 0;
+        uint16_t nPort;
     };
     const Listener tcp(SOCK_STREAM), quiet(SOCK_STREAM), udp(SOCK_DGRAM), mute(SOCK_DGRAM);
     std::thread answers([&] {

@@ -1,34 +1,24 @@
 // A web server on loopback for one request.
 #pragma once
 
-#include <arpa/inet.h>
-#include <gtest/gtest.h>
-#include <sys/socket.h>
-
 #include <string>
 #include <thread>
 
-#include "ground/Descriptor.h"
+#include "loopback.h"
 
 // Reads to the end of the request's headers and answers; the connection stays open until the next one or the end.
 class WebServer {
 public:
-    explicit WebServer(std::string szAnswer, const char* szAddress = "127.0.0.1") : mSzAnswer(std::move(szAnswer)) {
-        sockaddr_in own = {};
-        own.sin_family = AF_INET;
-        inet_pton(AF_INET, szAddress, &own.sin_addr);
-        socklen_t nLength = sizeof(own);
-        EXPECT_EQ(bind(mFd.Get(), reinterpret_cast<const sockaddr*>(&own), nLength), 0);
+    explicit WebServer(std::string szAnswer, const char* szAddress = "127.0.0.1")
+        : mSzAnswer(std::move(szAnswer)), mFd(SocketAt(szAddress, 0, SOCK_STREAM)) {
         EXPECT_EQ(listen(mFd.Get(), 1), 0);
-        EXPECT_EQ(getsockname(mFd.Get(), reinterpret_cast<sockaddr*>(&own), &nLength), 0);
-        mNPort = ntohs(own.sin_port);
         mThread = std::thread([this] { Serve(); });
     }
     ~WebServer() { Request(); }
     WebServer(const WebServer&) = delete;
     WebServer& operator=(const WebServer&) = delete;
 
-    int Port() const { return mNPort; }
+    int Port() const { return PortOf(mFd); }
     // What it was asked; waits for that.
     std::string Request() {
         if (mThread.joinable()) {
@@ -53,8 +43,7 @@ private:
 
     std::string mSzAnswer;
     std::string mSzRequest;
-    int mNPort = 0;
-    tavo::Descriptor mFd{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    tavo::Descriptor mFd;
     tavo::Descriptor mFdClient;
     std::thread mThread;
 };
