@@ -1081,6 +1081,12 @@ TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
     }
 }
 
+tavo::Record RecordOf(const std::string& szText, const char* szHardware = "aa:bb") {
+    tavo::Record record(szText, "one");
+    record.TurnTo({"192.168.1.1", szHardware});
+    return record;
+}
+
 // Of a router that has restarted, of one that is doubtful, and with time.
 TEST(Mapping, WhatIsKnownOfARouterIsForgottenAsFarAsItMayBeWrong) {
     // What comes of two rows, the box's and one of a former address, and whether a place elsewhere is known still.
@@ -1090,8 +1096,7 @@ TEST(Mapping, WhatIsKnownOfARouterIsForgottenAsFarAsItMayBeWrong) {
           {false, true, 0, "1 shown due, 2 shown due, ", false},
           {true, false, 0, "1, ", true},
           {true, true, 0, "1, ", false}}) {
-        tavo::Record record("", "boot");
-        record.TurnTo({"192.168.1.1", ""});
+        tavo::Record record = RecordOf("", "");
         record.Here() = {{{"TCP", 1}, {kBox, 1, "tavo:a", true, 3600, 1000}},
                          {{"TCP", 2}, {"192.168.1.4", 2, "tavo:a", true, 3600, 1000}}};
         tavo::Habits habit{.mapElsewhere = {{{"TCP", 3}, "offered 4"}}, .nElsewhereSince = 1000};
@@ -1154,8 +1159,7 @@ TEST(BootTimer, GoesByTheBootClock) {
 }
 
 TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
-    tavo::Record record("", "one");
-    record.TurnTo({"192.168.1.1", "aa:bb"});
+    tavo::Record record = RecordOf("");
     record.Here()[{"TCP", 1}] = {kBox, 11, "\"odd\n]text", true, 100, 5000};
     record.TurnTo({"192.168.1.1", "cc:dd"});
     EXPECT_TRUE(record.Here().empty()) << "another device at the same address";
@@ -1202,83 +1206,65 @@ TEST(Record, SurvivesAndKnowsRoutersAndBoots) {
     EXPECT_EQ(tavo::Record("[boot]\nid=\"x\"\n[broken\nprotocol=\"TCP\"\n", "x").Text(), "");
 }
 
+using Names = std::vector<std::string>;
+
 TEST(Mapping, WhatARouterThatCannotBeAskedMayStillHaveIsNamed) {
-    tavo::Record record("", "one");
-    record.TurnTo({"192.168.1.1", ""});
+    tavo::Record record = RecordOf("", "");
     record.Here() = {{{"TCP", 1}, {kBox, 1, "tavo:a"}},
                      {{"TCP", 2}, {kBox, 2, "tavo:wanted"}},
                      {{"TCP", 3}, {kBox, 3, "tavo:over", true, 100, 1000}},
                      {{"TCP", 4}, {kBox, 4, "tavo:moved"}}};
     for (const bool blForm : {false, true}) {
-        std::vector<std::string> rgszNames;
+        Names rgszNames;
         for (const tavo::Outcome& left :
              tavo::LeftOnRecord(record, {Entry(2, 2, "", "tavo:wanted"), Entry(4, 5, "", "tavo:moved")},
                                 {.blForm = blForm}, {tavo::Reply::kUnreachable, "noigd"}, 2000)) {
             EXPECT_TRUE(left.blLeftOver && left.verdict.enState == tavo::PortState::kUnknown);
             rgszNames.push_back(left.szName + " " + left.verdict.szWord);
         }
-        const std::vector<std::string> rgExpected = {"1/tcp noigd", "4/tcp noigd"};
-        EXPECT_EQ(rgszNames, (std::vector<std::string>{rgExpected.begin(), rgExpected.end() - (blForm ? 0 : 1)}))
+        EXPECT_EQ(rgszNames, blForm ? (Names{"1/tcp noigd", "4/tcp noigd"}) : Names{"1/tcp noigd"})
             << "a form has an entry beside the one that is to take its place";
     }
 }
 
 TEST(Record, LosesTheRowsThatCannotBeReadAndNoOther) {
-    tavo::Record record("", "one");
-    record.TurnTo({"192.168.1.1", "aa:bb"});
+    tavo::Record record = RecordOf("");
     for (const uint16_t nPort : {uint16_t{1}, uint16_t{2}, uint16_t{3}}) {
         record.Here()[{"TCP", nPort}] = {kBox, nPort, "tavo:a", true, 100, 5000};
     }
     const std::string szText = record.Text();
-    // What of the second row is written over.
-    for (const auto& [szOld, szNew, nRows] : {std::tuple("more=\"0\"", "more=\"65534\"", 3U),
-                                              {"more=\"0\"", "more=\"65535\"", 2U},  // beyond the last port
-                                              {"router_port=\"3\"", "router_port=\"0\"", 2U},
-                                              {"box_port=\"3\"", "box_port=\"0\"", 2U},
-                                              {"protocol=\"TCP\"", "protocol=\"ICMP\"", 2U}}) {
-        std::string szOdd = szText;
-        szOdd.replace(szOdd.find(szOld), std::string(szOld).size(), szNew);
-        tavo::Record odd(szOdd, "one");
-        odd.TurnTo({"192.168.1.1", "aa:bb"});
-        EXPECT_EQ(odd.Here().size(), nRows) << szNew;
+    const auto fnWith = [&szText](const std::string& szOld, size_t nOld, const std::string& szNew) {
+        return RecordOf(std::string(szText).replace(szText.find(szOld), nOld, szNew));
+    };
+    for (const auto& [szOld, szNew, szLeft] : {std::tuple("more=\"0\"", "more=\"65534\"", "1+65534 2 3"),
+                                               {"more=\"0\"", "more=\"65535\"", "2 3"},  // beyond the last port
+                                               {"router_port=\"3\"", "router_port=\"0\"", "1 2"},
+                                               {"box_port=\"3\"", "box_port=\"0\"", "1 2"},
+                                               {"protocol=\"TCP\"", "protocol=\"ICMP\"", "2 3"}}) {
+        EXPECT_EQ(PlacesIn(fnWith(szOld, std::string(szOld).size(), szNew).Here()), szLeft) << szNew;
     }
     for (const char* szDamaged : {"[192.168.1.1 TCP 2]", "router_port=\"2\"", "protocol=\"TCP\"\nrouter_port=\"2\""}) {
-        std::string szBad = szText;
-        szBad.replace(szText.find(szDamaged), 8, std::string("\0\xff\x1b\"=[\\q", 8));
-        tavo::Record damaged(szBad, "one");
-        damaged.TurnTo({"192.168.1.1", "aa:bb"});
-        EXPECT_EQ(damaged.Here().size(), 2U) << szDamaged;
-        EXPECT_TRUE((damaged.Here().contains({"TCP", 1}) && damaged.Here().contains({"TCP", 3}))) << szDamaged;
+        tavo::Record damaged = fnWith(szDamaged, 8, std::string("\0\xff\x1b\"=[\\q", 8));
+        EXPECT_EQ(PlacesIn(damaged.Here()), "1 3") << szDamaged;
     }
     for (const char* szAsked : {"-9223372036854775808", "9223372036854775807", "99999999999999999999"}) {
-        std::string szBad = szText;
-        szBad.replace(szText.find("5000"), 4, szAsked);
-        tavo::Record odd(szBad, "one");
-        odd.TurnTo({"192.168.1.1", "aa:bb"});
-        EXPECT_TRUE((odd.Here()[{"TCP", 1}].IsDue(6000))) << szAsked;
+        EXPECT_TRUE((fnWith("5000", 4, szAsked).Here()[{"TCP", 1}].IsDue(6000))) << szAsked;
     }
 }
 
-TEST(Record, OfOtherRoutersIsBounded) {
-    tavo::Record record("", "one");
-    record.TurnTo({"192.168.1.1", "aa:bb"});
-    for (int i = 1; i <= 5000; ++i) {
-        record.Here()[{"TCP", static_cast<uint16_t>(i)}] = {kBox, 1, "tavo:a", true, 0, 5000};
+// Within a bound, and what may have no lease for however long.
+TEST(Record, OfOtherRoutersIsKept) {
+    for (const auto& [nRows, blShown, nLease, nPrunedAt, nKept] :
+         {std::tuple(5000, true, 0U, 0, 4096U), {1, false, 100U, 5000 + 100 + 30 * 24 * 60 * 60, 1U}}) {
+        tavo::Record record = RecordOf("");
+        for (int i = 1; i <= nRows; ++i) {
+            record.Here()[{"TCP", static_cast<uint16_t>(i)}] = {kBox, 1, "tavo:a", blShown, nLease, 5000};
+        }
+        record.TurnTo({"192.168.1.1", "cc:dd"});
+        record.Prune(nPrunedAt);
+        record.TurnTo({"192.168.1.1", "aa:bb"});
+        EXPECT_EQ(record.Here().size(), nKept);
     }
-    record.TurnTo({"192.168.1.1", "cc:dd"});
-    record.Prune(0);
-    record.TurnTo({"192.168.1.1", "aa:bb"});
-    EXPECT_EQ(record.Here().size(), 4096U);
-}
-
-TEST(Record, KeepsWhatMayHaveNoLease) {
-    tavo::Record record("", "one");
-    record.TurnTo({"192.168.1.1", "aa:bb"});
-    record.Here()[{"TCP", 1}] = {kBox, 1, "tavo:a", false, 100, 5000};
-    record.TurnTo({"192.168.1.1", "cc:dd"});
-    record.Prune(5000 + 100 + 30 * 24 * 60 * 60);
-    record.TurnTo({"192.168.1.1", "aa:bb"});
-    EXPECT_EQ(record.Here().size(), 1U);
 }
 
 // Every port of both protocols, with texts as long as a router may show them.
@@ -1449,6 +1435,7 @@ TEST(Rules, WhatACutListNamesAtItsEndIsNotAskedFor) {
 // A router under test: some ports conflict, and some answers are lost after the work was done.
 class OddRouter : public MemoryRouter {
 public:
+    using MemoryRouter::MemoryRouter;
     RouterReply Add(RouterMapping& mapping) override {
         if (mSetConflicts.contains(mapping.nRouterPort)) {
             return IgdReply(tavo::kIgdConflict);
@@ -1476,72 +1463,57 @@ private:
     int mNAnswers = 0;
 };
 
-std::vector<tavo::TestRule> TestRules(uint16_t nFirst, int nRules) {
+std::vector<tavo::TestRule> TestRules(int nRules) {
     std::vector<tavo::TestRule> rgRules;
-    for (int i = 0; i < nRules; ++i) {
-        rgRules.push_back({static_cast<uint16_t>(nFirst + i), static_cast<uint16_t>(nFirst + i), false, ""});
+    for (int i = 10; i < 10 + nRules; ++i) {
+        rgRules.push_back({static_cast<uint16_t>(i), static_cast<uint16_t>(i), false, ""});
     }
     return rgRules;
 }
 
-std::vector<int> Ports(const OddRouter& router, const char* szPrefix) {
-    std::vector<int> rgPorts;
-    for (const auto& [key, mapping] : router.mMapTable) {
-        if (mapping.szDescription.starts_with(szPrefix)) {
-            rgPorts.push_back(key.second * 100 + mapping.nBoxPort);
-        }
-    }
-    return rgPorts;
+std::string TestPlaces(std::map<tavo::MappingKey, RouterMapping> mapTable) {
+    std::erase_if(mapTable, [](const auto& row) { return !row.second.szDescription.starts_with("tavotest:"); });
+    return PlacesIn(mapTable);
 }
 
+const auto kAnyPort = [](uint16_t) { return true; };
 const auto kGoOn = [] { return false; };
 
 TEST(TestMappings, TakeOnlyWhatNobodyHasAndLeaveTheTableAsItWas) {
     for (const int nListCode : {static_cast<int>(tavo::kWireOk), 401}) {
         for (const int nLoseEvery : {0, 3}) {
             SCOPED_TRACE(nListCode + nLoseEvery);
-            OddRouter router;
-            for (const RouterMapping& mapping :
-                 {Entry(11, 1, kBox, "tavo:rule"), Entry(12, 12, "192.168.1.9", "tavotest:12"),
-                  Entry(13, 3, kBox, "game")}) {
-                router.mMapTable[{"TCP", mapping.nRouterPort}] = mapping;
-            }
-            const auto mapBefore = router.mMapTable;
+            OddRouter router("11>1=tavo:rule 12@9=tavotest:12 13>3=game");
+            const std::string szBefore = PlacesIn(router.mMapTable);
             router.mSetConflicts = {15};
             router.mNListCode = nListCode;
             router.mNLoseEvery = nLoseEvery;
             if (nListCode == tavo::kWireOk) {
-                router.mMapTable[{"TCP", 40}] = Entry(40, 40, kBox, "tavotest:40");  // of one that was killed
+                router.Put(Entry(40, 40, kBox, "tavotest:40"));  // of one that was killed
             }
-            tavo::TestMappings test(router, kBox, TestRules(10, 4), [](uint16_t nPort) { return nPort != 16; });
+            tavo::TestMappings test(router, kBox, TestRules(4), [](uint16_t nPort) { return nPort != 16; });
             EXPECT_TRUE(test.Add(kGoOn));
-            const auto rgMade = Ports(router, "tavotest:");
-            const std::vector<int> rgWanted = {1010, 1212, 1414, 1717, 1818};
             if (nListCode == tavo::kWireOk) {
-                EXPECT_EQ(rgMade, rgWanted);
+                EXPECT_EQ(TestPlaces(router.mMapTable), "10 12@9 14 17 18");
             }
             EXPECT_TRUE(test.Readd(kGoOn));
             EXPECT_TRUE(test.Change(kGoOn));
             if (nListCode == tavo::kWireOk) {
-                EXPECT_EQ(Ports(router, "tavotest:"), (std::vector<int>{1014, 1212, 1417, 1718, 1810}));
+                EXPECT_EQ(TestPlaces(router.mMapTable), "10>14 12@9 14>17 17>18 18>10");
             }
             EXPECT_TRUE(test.Remove(kGoOn));
-            EXPECT_EQ(Ports(router, ""), [&] {
-                OddRouter before;
-                before.mMapTable = mapBefore;
-                return Ports(before, "");
-            }());
+            EXPECT_EQ(PlacesIn(router.mMapTable), szBefore);
         }
     }
 }
 
 TEST(TestMappings, NeverTouchAPortThatBecameAnotherHosts) {
     OddRouter router;
-    tavo::TestMappings test(router, kBox, TestRules(10, 3), [](uint16_t) { return true; });
+    tavo::TestMappings test(router, kBox, TestRules(3), kAnyPort);
     ASSERT_TRUE(test.Add(kGoOn));
     router.mMapTable[{"TCP", 11}].szClient = "192.168.1.9";  // the router restarted, and another host was faster
     EXPECT_TRUE(test.Remove(kGoOn));
-    EXPECT_EQ(Ports(router, ""), std::vector<int>{1111});
+    EXPECT_EQ(PlacesIn(router.mMapTable), "11@9");
 }
 
 TEST(TestMappings, ARouterThatFallsSilentFailsSoon) {
@@ -1549,7 +1521,7 @@ TEST(TestMappings, ARouterThatFallsSilentFailsSoon) {
          {&tavo::TestMappings::Add, &tavo::TestMappings::Readd, &tavo::TestMappings::Change,
           &tavo::TestMappings::Remove}) {
         OddRouter router;
-        tavo::TestMappings test(router, kBox, TestRules(10, 60), [](uint16_t) { return true; });
+        tavo::TestMappings test(router, kBox, TestRules(60), kAnyPort);
         ASSERT_TRUE(test.Add(kGoOn));
         router.mBlSilent = true;
         router.mNListCode = tavo::kWireTimeout;
@@ -1561,10 +1533,10 @@ TEST(TestMappings, ARouterThatFallsSilentFailsSoon) {
 
 TEST(TestMappings, OneThatIsKeptIsChangedToo) {
     OddRouter router;
-    tavo::TestMappings test(router, kBox, TestRules(10, 1), [](uint16_t) { return true; });
+    tavo::TestMappings test(router, kBox, TestRules(1), kAnyPort);
     ASSERT_TRUE(test.Add(kGoOn));
     EXPECT_TRUE(test.Change(kGoOn));
-    EXPECT_EQ(Ports(router, ""), std::vector<int>{1011});
+    EXPECT_EQ(PlacesIn(router.mMapTable), "10>11");
 }
 
 }  // namespace
