@@ -362,36 +362,31 @@ TEST(Igd, OfSeveralLinesTheOneThatIsUpIsUsed) {
     const Lines::Line inside{"Connected", "100.64.0.9"};
     const Lines::Line outside{"Connected", "198.41.0.4"};
     const Lines::Line none{"Connected", ""};
-    struct Case {
-        std::vector<Lines::Line> rgLines;
-        const char* szKnown;
-        const char* szUsed;
-        int nPosts;
-    };
-    const Case rgCases[] = {{{down}, "", "/1", 0},  // there is nothing to choose
-                            {{down, outside}, "", "/2", 4},
-                            {{outside, down}, "", "/1", 4},
-                            {{inside, outside}, "", "/2", 4},
-                            {{none, inside}, "", "/2", 4},
-                            {{mute, none}, "", "/2", 4},
-                            {{down, mute}, "", "/2", 4},
-                            {{mute, mute}, "", "/1", 4},
-                            {{{"Disconnected", "198.41.0.4"}, none}, "", "/2", 4},
-                            {{{"?", "198.41.0.4"}, {"?", "10.0.0.4"}}, "", "/1", 4},
-                            {{inside, outside}, kFirst, "/1", 1},
-                            {{outside, inside}, kSecond, "/2", 3},
-                            {{down, inside}, kFirst, "/2", 4},
-                            {{down, down}, kSecond, "/2", 4},
-                            {{inside, outside}, "/9 x", "/2", 4}};
-    for (const Case& one : rgCases) {
-        const auto pLines = std::make_shared<Lines>(one.rgLines);
+    const std::tuple<std::vector<Lines::Line>, const char*, const char*, int> rgCases[] = {
+        {{down}, "", "/1", 0},  // there is nothing to choose
+        {{down, outside}, "", "/2", 4},
+        {{outside, down}, "", "/1", 4},
+        {{inside, outside}, "", "/2", 4},
+        {{none, inside}, "", "/2", 4},
+        {{mute, none}, "", "/2", 4},
+        {{down, mute}, "", "/2", 4},
+        {{mute, mute}, "", "/1", 4},
+        {{{"Disconnected", "198.41.0.4"}, none}, "", "/2", 4},
+        {{{"?", "198.41.0.4"}, {"?", "10.0.0.4"}}, "", "/1", 4},
+        {{inside, outside}, kFirst, "/1", 1},
+        {{outside, inside}, kSecond, "/2", 3},
+        {{down, inside}, kFirst, "/2", 4},
+        {{down, down}, kSecond, "/2", 4},
+        {{inside, outside}, "/9 x", "/2", 4}};
+    for (const auto& [rgLines, szKnown, szUsed, nPosts] : rgCases) {
+        const auto pLines = std::make_shared<Lines>(rgLines);
         std::string szWhy;
-        const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pLines, szWhy, one.szKnown);
-        EXPECT_EQ(pIgd->Service().control.szPath, one.szUsed) << &one - rgCases;
-        EXPECT_EQ(pLines->mNPosts, one.nPosts) << &one - rgCases;
-        EXPECT_EQ(pIgd->IsOneOfSeveral(), one.rgLines.size() > 1);
+        const auto pIgd = tavo::Igd::At({"192.168.1.1", 80, "/"}, pLines, szWhy, szKnown);
+        EXPECT_EQ(pIgd->Service().control.szPath, szUsed) << szKnown << nPosts;
+        EXPECT_EQ(pLines->mNPosts, nPosts) << szKnown << szUsed;
+        EXPECT_EQ(pIgd->IsOneOfSeveral(), rgLines.size() > 1);
         const auto pFirst = pIgd->Beside(kFirst);
-        EXPECT_EQ(pFirst != nullptr, one.szUsed != std::string("/1"));
+        EXPECT_EQ(pFirst != nullptr, szUsed != std::string("/1"));
         EXPECT_TRUE(pFirst == nullptr || pFirst->Service().control.szPath == "/1");
     }
 }
@@ -437,29 +432,22 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
 }
 
 TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
-    struct Case {
-        int nEntries;
-        int nEnd;
-        int nSeconds;
-        int nCode;
-        size_t nShown;
-    };
     const JumpingClock clock;
-    const Case rgCases[] = {{0, 713, 0, 0, 0}, {2, 713, 0, 0, 2},
-                            {0, 714, 0, 0, 0}, {2, 714, 0, 0, 2},
-                            {2, 402, 0, 0, 2}, {0, 402, 0, 402, 0},
-                            {2, 501, 0, 0, 2}, {0, 401, 0, 401, 0},
-                            {7, 713, 1, 0, 7}, {99, 713, 1, tavo::kWireTooLong, 8}};
-    for (const Case& one : rgCases) {
+    const std::tuple<int, int, int, int, size_t> rgCases[] = {{0, 713, 0, 0, 0},   {2, 713, 0, 0, 2},
+                                                              {0, 714, 0, 0, 0},   {2, 714, 0, 0, 2},
+                                                              {2, 402, 0, 0, 2},   {0, 402, 0, 402, 0},
+                                                              {2, 501, 0, 0, 2}, {0, 401, 0, 401, 0},
+                                                              {7, 713, 1, 0, 7},   {99, 713, 1, tavo::kWireTooLong, 8}};
+    for (const auto& [nEntries, nEnd, nSeconds, nCode, nShown] : rgCases) {
         const auto pHttp = std::make_shared<Table>();
-        for (int i = 1; i <= one.nEntries; ++i) {
+        for (int i = 1; i <= nEntries; ++i) {
             pHttp->mRgEntries.emplace_back(i, "192.168.1.5");
         }
-        pHttp->mNEnd = one.nEnd;
-        pHttp->mNSeconds = one.nSeconds;
+        pHttp->mNEnd = nEnd;
+        pHttp->mNSeconds = nSeconds;
         std::vector<IgdEntry> rgMappings;
-        EXPECT_EQ(IgdAt(pHttp)->List(rgMappings), one.nCode) << &one - rgCases;
-        EXPECT_EQ(rgMappings.size(), one.nShown) << &one - rgCases;
+        EXPECT_EQ(IgdAt(pHttp)->List(rgMappings), nCode) << nEntries << " " << nEnd;
+        EXPECT_EQ(rgMappings.size(), nShown) << nEntries << " " << nEnd;
     }
 }
 

@@ -46,14 +46,7 @@ TEST(Level, AddressesAreToldApartAtTheEdgesOfTheirBlocks) {
 TEST(Level, CountsEveryTranslationThatTheEvidenceShowsAndNoOther) {
     constexpr const char* kNone = nullptr;
     constexpr int kUntold = -1;
-    struct Case {
-        const char* szOwn;
-        const char* szExternal;
-        bool blElsewhere;
-        std::vector<const char*> rgszBeyond;
-        int nLevel;
-    };
-    const Case rgCases[] = {
+    const std::tuple<const char*, const char*, bool, std::vector<const char*>, int> rgCases[] = {
         {"203.0.113.5", kNone, false, {}, 0},
         {"192.168.1.5", "198.41.0.4", false, {}, 1},
         {"192.168.1.5", "198.41.0.4", false, {"10.1.1.1", "100.64.0.1"}, 1},  // the provider's own routers
@@ -72,18 +65,18 @@ TEST(Level, CountsEveryTranslationThatTheEvidenceShowsAndNoOther) {
         {"192.168.1.5", "169.254.1.1", false, {kNone, "203.0.113.1"}, 1},
         {"100.64.0.5", kNone, false, {}, 2},
         {"169.254.1.5", kNone, false, {}, kUntold}};
-    for (const Case& check : rgCases) {
+    for (const auto& [szOwn, szExternal, blElsewhere, rgszBeyond, nLevel] : rgCases) {
         tavo::LevelEvidence evidence;
-        evidence.own = Address(check.szOwn);
-        if (check.szExternal != nullptr) {
-            evidence.external = Address(check.szExternal);
+        evidence.own = Address(szOwn);
+        if (szExternal != nullptr) {
+            evidence.external = Address(szExternal);
         }
-        evidence.blExternalElsewhere = check.blElsewhere;
-        for (const char* szRouter : check.rgszBeyond) {
+        evidence.blExternalElsewhere = blElsewhere;
+        for (const char* szRouter : rgszBeyond) {
             evidence.rgBeyond.push_back(szRouter == nullptr ? std::nullopt : std::optional<in_addr>(Address(szRouter)));
         }
-        EXPECT_EQ(tavo::LevelOf(evidence).value_or(kUntold), check.nLevel)
-            << &check - rgCases << ": " << check.szOwn << " " << (check.szExternal == nullptr ? "-" : check.szExternal);
+        EXPECT_EQ(tavo::LevelOf(evidence).value_or(kUntold), nLevel)
+            << szOwn << " " << (szExternal == nullptr ? "-" : szExternal) << " " << rgszBeyond.size();
     }
 }
 

@@ -95,27 +95,23 @@ TEST(NatpmpPacket, AnnouncementsOfBothProtocols) {
         rgBytes[11] = 2;
         return rgBytes;
     };
-    struct Case {
-        Bytes rgDatagram;
-        std::string szRead;
-    };
-    const Case rgCases[] = {{{0, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, "NAT-PMP 258"},
-                            {{0, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0}, ""},
-                            {{0, 128, 0, 3, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
-                            {{0, 129, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
-                            {{1, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
-                            {{}, ""},
-                            {fnPcp(2, 0x80, 0, 24), "PCP 258"},
-                            {fnPcp(2, 0x80, 0, 28), "PCP 258"},
-                            {fnPcp(2, 0x80, 0, 23), ""},
-                            {fnPcp(2, 0x00, 0, 24), ""},
-                            {fnPcp(2, 0x81, 0, 24), ""},
-                            {fnPcp(2, 0x80, 1, 24), ""},
-                            {fnPcp(3, 0x80, 0, 24), ""}};
-    for (const Case& one : rgCases) {
-        const auto read = tavo::ReadAnnouncement(one.rgDatagram);
-        EXPECT_EQ(read ? (read->blPcp ? "PCP " : "NAT-PMP ") + std::to_string(read->nEpoch) : "", one.szRead)
-            << &one - rgCases;
+    const std::pair<Bytes, std::string> rgCases[] = {{{0, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, "NAT-PMP 258"},
+                                                     {{0, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0}, ""},
+                                                     {{0, 128, 0, 3, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
+                                                     {{0, 129, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
+                                                     {{1, 128, 0, 0, 0, 0, 1, 2, 198, 41, 0, 4}, ""},
+                                                     {{}, ""},
+                                                     {fnPcp(2, 0x80, 0, 24), "PCP 258"},
+                                                     {fnPcp(2, 0x80, 0, 28), "PCP 258"},
+                                                     {fnPcp(2, 0x80, 0, 23), ""},
+                                                     {fnPcp(2, 0x00, 0, 24), ""},
+                                                     {fnPcp(2, 0x81, 0, 24), ""},
+                                                     {fnPcp(2, 0x80, 1, 24), ""},
+                                                     {fnPcp(3, 0x80, 0, 24), ""}};
+    for (const auto& [rgDatagram, szRead] : rgCases) {
+        const auto read = tavo::ReadAnnouncement(rgDatagram);
+        EXPECT_EQ(read ? (read->blPcp ? "PCP " : "NAT-PMP ") + std::to_string(read->nEpoch) : "", szRead)
+            << testing::PrintToString(rgDatagram);
     }
 }
 
