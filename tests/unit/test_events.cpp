@@ -251,26 +251,22 @@ TEST_F(EventsTest, WhatIsNoNoticeOfOursIsNoNews) {
         return szStart + std::string(nSize - szStart.size(), 'x');
     };
     EXPECT_EQ(mPRouter->Path().size(), 33U) << "nobody guesses it";
-    struct Case {
-        const char* szWhat;
-        std::string szText;
-        std::string szAnswer;
-    };
-    const Case rgCases[] = {{"another subscription", Notice(1, kCount, "uuid:11"), "HTTP/1.1 412"},
-                            {"no subscription", fnWithout("SID:"), "HTTP/1.1 412"},
-                            {"no number", fnWithout("SEQ:"), "HTTP/1.1 400"},
-                            {"no length", fnWithout("Content-Length:"), "HTTP/1.1 400"},
-                            {"another method", Notice(1, kCount, "uuid:1", "POST"), "HTTP/1.1 400"},
-                            {"another path", "NOTIFY /0" + szGood.substr(szGood.find(' ', 7)), "HTTP/1.1 404"},
-                            {"no HTTP", "\r\n\r\n", "HTTP/1.1 400"},
-                            {"headers without end", fnLong(8192), "HTTP/1.1 400"},
-                            {"headers that may have one", fnLong(8191), "-"},
-                            {"a body without end", Notice(1, std::string(9000, 'x') + kCount), "HTTP/1.1 400"},
-                            {"cut short", szGood.substr(0, szGood.size() - 1), "-"}};
-    for (const Case& one : rgCases) {
-        std::string szAnswer;
-        EXPECT_FALSE(IsNews(one.szText, &szAnswer)) << one.szWhat;
-        EXPECT_EQ(szAnswer, one.szAnswer) << one.szWhat;
+    const std::tuple<const char*, std::string, std::string> rgCases[] = {
+        {"another subscription", Notice(1, kCount, "uuid:11"), "HTTP/1.1 412"},
+        {"no subscription", fnWithout("SID:"), "HTTP/1.1 412"},
+        {"no number", fnWithout("SEQ:"), "HTTP/1.1 400"},
+        {"no length", fnWithout("Content-Length:"), "HTTP/1.1 400"},
+        {"another method", Notice(1, kCount, "uuid:1", "POST"), "HTTP/1.1 400"},
+        {"another path", "NOTIFY /0" + szGood.substr(szGood.find(' ', 7)), "HTTP/1.1 404"},
+        {"no HTTP", "\r\n\r\n", "HTTP/1.1 400"},
+        {"headers without end", fnLong(8192), "HTTP/1.1 400"},
+        {"headers that may have one", fnLong(8191), "-"},
+        {"a body without end", Notice(1, std::string(9000, 'x') + kCount), "HTTP/1.1 400"},
+        {"cut short", szGood.substr(0, szGood.size() - 1), "-"}};
+    for (const auto& [szWhat, szText, szAnswer] : rgCases) {
+        std::string szSaid;
+        EXPECT_FALSE(IsNews(szText, &szSaid)) << szWhat;
+        EXPECT_EQ(szSaid, szAnswer) << szWhat;
     }
     const tavo::Descriptor fdNeighbour = Connect(kNeighbour);
     Send(fdNeighbour, szGood);

@@ -102,11 +102,8 @@ TEST_F(Library, RuleArrays) {
 
 TEST_F(Library, RuleFilesThatCannotBeConverted) {
     const std::string szPorts = "s_port=1\nr_port=2\n";
-    const struct {
-        std::string szText;
-        int nRules;  // on failure the count keeps the number of sections
-        std::vector<std::string> rgszLines;
-    } rgCases[] = {
+    // nTold: on failure the count keeps the number of sections.
+    const std::tuple<std::string, int, std::vector<std::string>> rgCases[] = {
         {"[1]\n" + szPorts + "protocol name=tcp\n", 1, {"get rule enable failed", "IsRuleEnable() failed"}},
         {"[1]\n[2]\n[3]\n", 3, {"section shall not be empty", "IsRuleEnable() failed"}},
         {"[1]\nenabled=1\nr_port=2\n", 1, {"get rule src port failed", "GetRulePort() failed"}},
@@ -114,9 +111,9 @@ TEST_F(Library, RuleFilesThatCannotBeConverted) {
         {"[1]\nenabled=1\n" + szPorts, 1, {"get protocol failed", "GetRuleProtocol() failed"}},
         {"# nothing\n", 7, {"TAVOPFRuleGetByIdList() failed"}},
     };
-    for (const auto& broken : rgCases) {
-        Write(kRuleConf, broken.szText);
-        std::vector<std::string> rgszLines = broken.rgszLines;
+    for (const auto& [szText, nTold, rgszSaid] : rgCases) {
+        Write(kRuleConf, szText);
+        std::vector<std::string> rgszLines = rgszSaid;
         if (rgszLines.size() > 1) {
             rgszLines.push_back("PF_CONF::ToArray() failed");
         }
@@ -125,7 +122,7 @@ TEST_F(Library, RuleFilesThatCannotBeConverted) {
         gLog.clear();
         EXPECT_EQ(TLibGetRulesArrFromRuleConf(&nRules, &pRules, nullptr, false, nullptr), -1);
         EXPECT_EQ(gLog, rgszLines);
-        EXPECT_EQ(nRules, broken.nRules) << broken.szText;
+        EXPECT_EQ(nRules, nTold) << szText;
         EXPECT_EQ(pRules, nullptr);
     }
     int nRules = 7;
@@ -626,12 +623,8 @@ TEST_F(Library, CompatibilityDatabaseOfTwoFiles) {
 
 // What the settings of a router say, as each of its readers tells it: the words, "yes" or not, and what it can do.
 TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
-    const struct {
-        const char* szAddress;
-        const char* szStored;
-        const char* szWords;  // UPnP, NAT-PMP, whether each is "yes", and the limit; "-": not told
-        int nDescribed;
-    } rgCases[] = {
+    // szTold: UPnP, NAT-PMP, whether each is "yes", and the limit; "-": not told.
+    const std::tuple<const char*, const char*, const char*, int> rgCases[] = {
         {"192.168.1.1", "support_router_upnp=yes\nsupport_router_natpmp=no\nmax=5\n", "yes no 1 0 5", 0},
         {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=unknown\n", "no unknown 0 0 -", 0},
         {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=no\nmax=x\n", "no no 0 0 0", -1},
@@ -639,9 +632,9 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         {"no address", "support_router_upnp=no\nsupport_router_natpmp=no\n", "- - - - -", -1},
         {"192.168.1.1", "brand=x\n", "  0 0 -", 0},
     };
-    for (const auto& stored : rgCases) {
-        Write(kRouterConf, std::string("[192.168.1.1]\n") + stored.szStored);
-        RouterConfReader reader(stored.szAddress);
+    for (const auto& [szAddress, szStored, szTold, nDescribed] : rgCases) {
+        Write(kRouterConf, std::string("[192.168.1.1]\n") + szStored);
+        RouterConfReader reader(szAddress);
         std::string szUpnp, szNatpmp;
         bool blUpnp = false, blNatpmp = false;
         int nMax = 0;
@@ -655,17 +648,17 @@ TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
         for (size_t i = 0; i < std::size(rgAnswers); ++i) {
             szWords += (i == 0 ? "" : " ") + (rgAnswers[i] == 1 ? rgszTold[i] : "-");
         }
-        EXPECT_EQ(szWords, stored.szWords) << stored.szStored;
+        EXPECT_EQ(szWords, szTold) << szStored;
         std::string szName;
         const bool blFound = reader.GetSectionName(szName) == 1;
         EXPECT_EQ(szName, blFound ? "192.168.1.1" : "");
-        EXPECT_EQ(blFound, szName == stored.szAddress);
+        EXPECT_EQ(blFound, szName == szAddress);
         for (const char* szLine : {"get support upnp fail", "get support natpmp fail"}) {
             EXPECT_EQ(Logged(szLine), szWords == "- - - - -") << szLine;
         }
         __tag_TAVO_ROUTER_DESC desc = {true};
         auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
-        EXPECT_EQ(TLibGetRouterDesc(stored.szAddress, &desc, &enErr, true), stored.nDescribed) << stored.szStored;
+        EXPECT_EQ(TLibGetRouterDesc(szAddress, &desc, &enErr, true), nDescribed) << szStored;
         EXPECT_EQ(Logged("get support change port failed") && Logged("pRouterConf shall not be NULL"),
                   szWords == "no no 0 0 0");
         EXPECT_EQ(enErr, TAVO_LIBTAVOPORTMAP_ERR_FAILED);

@@ -152,29 +152,23 @@ const Lines kAsked{"8080 at 80 for 3600"};
 constexpr char kNatpmpMade[] = "/var/lib/tavo/natpmp_made.conf";
 
 TEST_F(NatpmpMapping, AGatewayThatHasBegunAnewIsAskedForAllAgain) {
-    struct Case {
-        const char* szWhat;
-        int nSeconds;  // since the one before
-        uint32_t nEpoch;
-        bool blAsked;
-        int nNext;
-    };
-    const Case rgCases[] = {{"the first", 0, 1000, true, 10},
-                            {"it goes on", 10, 1010, false, 10},
-                            {"it goes on", 10, 1020, false, 20},
-                            {"it has begun anew", 20, 12, true, 10},
-                            {"it goes on", 10, 22, false, 10},
-                            {"it has just begun anew", 20, 3, true, 10},
-                            {"so young that it may have begun once more", 3, 4, true, 10},
-                            {"and once more", 3, 7, true, 10},
-                            {"which this looks at for the last time", 10, 17, true, 40},
-                            {"it goes on", 10, 27, false, 80}};
+    const std::tuple<const char*, int, uint32_t, bool, int> rgCases[] = {
+        {"the first", 0, 1000, true, 10},
+        {"it goes on", 10, 1010, false, 10},
+        {"it goes on", 10, 1020, false, 20},
+        {"it has begun anew", 20, 12, true, 10},
+        {"it goes on", 10, 22, false, 10},
+        {"it has just begun anew", 20, 3, true, 10},
+        {"so young that it may have begun once more", 3, 4, true, 10},
+        {"and once more", 3, 7, true, 10},
+        {"which this looks at for the last time", 10, 17, true, 40},
+        {"it goes on", 10, 27, false, 80}};
     tavo::NatpmpMapper mapper;
-    for (const Case& one : rgCases) {
-        gNClockJumped += one.nSeconds;
-        mGateway.mNEpoch = one.nEpoch;
-        EXPECT_EQ(Pass(mapper, &one == rgCases), one.nNext) << one.szWhat << " " << one.nEpoch;
-        EXPECT_EQ(mGateway.TakeAsked(), one.blAsked ? kAsked : Lines()) << one.szWhat << " " << one.nEpoch;
+    for (const auto& [szWhat, nSeconds, nEpoch, blAsked, nNext] : rgCases) {
+        gNClockJumped += nSeconds;
+        mGateway.mNEpoch = nEpoch;
+        EXPECT_EQ(Pass(mapper, nSeconds == 0), nNext) << szWhat << " " << nEpoch;
+        EXPECT_EQ(mGateway.TakeAsked(), blAsked ? kAsked : Lines()) << szWhat << " " << nEpoch;
         EXPECT_EQ(Result(), "");
     }
     for (const auto& [cEpoch, blNews] : {std::pair('\36', false), {'\2', true}}) {  // held against its last answer
@@ -238,30 +232,25 @@ TEST_F(NatpmpMapping, WhatLedToAFormerAddressIsTakenAwayFromThereOrWaitedFor) {
 
 // Leases run by the clock of the boot, as the router's do.
 TEST_F(NatpmpMapping, AClockThatIsSetChangesNothing) {
-    struct Case {
-        int nAhead;
-        bool blBoth;  // rules; else the first
-        bool blRequested;
-        Lines rgszAsked;
-    };
+    // blBoth: rules; else the first.
     const Lines both{kAsked[0], "8081 at 81 for 3600"};
-    const Case rgCases[] = {{0, true, true, both},
-                            {7200, true, false, {}},
-                            {0, true, false, {}},
-                            {-7200, true, false, {}},
-                            {7200, true, true, both},
-                            {0, true, false, {}},
-                            {0, false, true, {"8081 ends", kAsked[0]}},
-                            {7200, false, false, {}}};
+    const std::tuple<int, bool, bool, Lines> rgCases[] = {{0, true, true, both},
+                                                          {7200, true, false, {}},
+                                                          {0, true, false, {}},
+                                                          {-7200, true, false, {}},
+                                                          {7200, true, true, both},
+                                                          {0, true, false, {}},
+                                                          {0, false, true, {"8081 ends", kAsked[0]}},
+                                                          {7200, false, false, {}}};
     tavo::NatpmpMapper mapper;
-    for (const Case& one : rgCases) {
+    for (const auto& [nAhead, blBoth, blRequested, rgszAsked] : rgCases) {
         After(10);
-        gNClockAhead = one.nAhead;
+        gNClockAhead = nAhead;
         Rules rgRules{{"80", "8080"}, {"81", "8081"}};
-        rgRules.resize(one.blBoth ? 2 : 1);
+        rgRules.resize(blBoth ? 2 : 1);
         SetRules(rgRules);
-        Pass(mapper, one.blRequested);
-        EXPECT_EQ(mGateway.TakeAsked(), one.rgszAsked) << &one - rgCases;
+        Pass(mapper, blRequested);
+        EXPECT_EQ(mGateway.TakeAsked(), rgszAsked) << nAhead << blRequested;
         EXPECT_EQ(Result(), "");
     }
     gNClockAhead = 0;

@@ -1114,25 +1114,21 @@ TEST(Mapping, WhatIsKnownOfARouterIsForgottenAsFarAsItMayBeWrong) {
 
 // Often after a change, seldom in peace; a router that fails is looked for anew at every third time.
 TEST(Keeper, LooksSoonAfterAChangeAndSeldomInPeace) {
-    struct Pass {
-        bool blFails;
-        bool blChange;
-        int nDue;  // of the pass itself
-        int nSeconds;
-        bool blLost;
-    };
-    const Pass rgPasses[] = {{false, true, 0, 10, false}, {false, false, 0, 20, false},  {false, false, 0, 40, false},
-                             {false, false, 7, 7, false}, {false, false, 0, 120, false}, {false, false, 0, 120, false},
-                             {true, false, 0, 10, false}, {true, false, 0, 10, false},   {true, false, 0, 10, true},
-                             {true, false, 0, 10, false}, {false, false, 0, 10, false},  {false, false, 500, 20, false},
-                             {true, false, 0, 10, false}, {true, false, 0, 10, false},   {false, true, 3, 3, false}};
+    // Whether it fails and whether something changes, when the pass itself is due, the seconds, whether one is lost.
+    const std::tuple<bool, bool, int, int, bool> rgPasses[] = {
+        {false, true, 0, 10, false}, {false, false, 0, 20, false},  {false, false, 0, 40, false},
+        {false, false, 7, 7, false}, {false, false, 0, 120, false}, {false, false, 0, 120, false},
+        {true, false, 0, 10, false}, {true, false, 0, 10, false},   {true, false, 0, 10, true},
+        {true, false, 0, 10, false}, {false, false, 0, 10, false},  {false, false, 500, 20, false},
+        {true, false, 0, 10, false}, {true, false, 0, 10, false},   {false, true, 3, 3, false}};
     tavo::Keeper keeper;
-    for (size_t i = 0; i < std::size(rgPasses); ++i) {
+    for (const auto& [blFails, blChange, nDue, nSeconds, blLost] : rgPasses) {
         tavo::PassResult result;
-        result.transport = {rgPasses[i].blFails ? tavo::Reply::kTimeout : tavo::Reply::kOk};
-        result.nNextSeconds = rgPasses[i].nDue;
-        const tavo::NextLook next = keeper.After(result, rgPasses[i].blChange, 120);
-        EXPECT_EQ(std::pair(next.nSeconds, next.blLost), std::pair(rgPasses[i].nSeconds, rgPasses[i].blLost)) << i;
+        result.transport = {blFails ? tavo::Reply::kTimeout : tavo::Reply::kOk};
+        result.nNextSeconds = nDue;
+        const tavo::NextLook next = keeper.After(result, blChange, 120);
+        EXPECT_EQ(std::pair(next.nSeconds, next.blLost), std::pair(nSeconds, blLost))
+            << blFails << blChange << " " << nDue;
     }
     EXPECT_EQ(tavo::Keeper().After({}, false, 120).nSeconds, 10) << "the first one";
     EXPECT_EQ(tavo::Keeper().After({}, true, 1).nSeconds, 1) << "never longer than the user wants it";

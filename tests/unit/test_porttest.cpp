@@ -19,13 +19,7 @@ constexpr char kMarker[] = "/tmp/pfStatusRule";
 TEST(RuleVerdict, TheWorstPortDecidesAndEveryPortIsNamed) {
     constexpr int D = TAVO_PORT_DISABLED, U = TAVO_PORT_UNKNOWN, O = TAVO_PORT_OPEN, R = TAVO_PORT_REFUSED,
                   T = TAVO_PORT_TIMEOUT, N = TAVO_PORT_NOLISTEN;
-    struct Case {
-        std::vector<std::pair<int, const char*>> rgPorts;
-        size_t nLeftOut;
-        int enStatus;
-        const char* szText;
-    };
-    const Case rgCases[] = {
+    const std::tuple<std::vector<std::pair<int, const char*>>, size_t, int, const char*> rgCases[] = {
         {{}, 0, U, ""},
         {{}, 2, U, "2 more ports: not tested"},
         {{{O, "o"}}, 0, O, "1: o"},
@@ -39,14 +33,14 @@ TEST(RuleVerdict, TheWorstPortDecidesAndEveryPortIsNamed) {
         {{{D, "d"}, {O, "o"}}, 0, O, "2: o; 1: d"},
         {{{R, "b"}, {R, "a"}, {R, "b"}}, 0, R, "2: a; 1, 3: b"},
         {std::vector<std::pair<int, const char*>>(9, {O, "o"}), 0, O, "1, 2, 3, 4, 5, 6 and 3 more: o"}};
-    for (const Case& check : rgCases) {
+    for (const auto& [rgPorts, nLeftOut, enMerged, szText] : rgCases) {
         std::vector<tavo::NamedVerdict> rgNamed;
-        for (const auto& [enStatus, szReason] : check.rgPorts) {
+        for (const auto& [enStatus, szReason] : rgPorts) {
             rgNamed.push_back({std::to_string(rgNamed.size() + 1), {enStatus, szReason}});
         }
-        const tavo::PortVerdict merged = tavo::MergeVerdicts(rgNamed, check.nLeftOut);
-        EXPECT_EQ(merged.enStatus, check.enStatus) << check.szText;
-        EXPECT_EQ(merged.szReason, check.szText);
+        const tavo::PortVerdict merged = tavo::MergeVerdicts(rgNamed, nLeftOut);
+        EXPECT_EQ(merged.enStatus, enMerged) << szText;
+        EXPECT_EQ(merged.szReason, szText);
     }
 }
 

@@ -25,11 +25,8 @@ using Relay = StagedTest;
 // ---- port lists ---------------------------------------------------------------------------------------
 
 TEST_F(Relay, PortListsAreReadInTheirOrder) {
-    const struct {
-        const char* szText;
-        Ports ports;
-        const char* szLine;  // what a failure logs; empty: success
-    } rgCases[] = {
+    // szLine: what a failure logs; empty: success.
+    const std::tuple<const char*, Ports, const char*> rgCases[] = {
         {"80", {80}, ""},
         {"80,443", {80, 443}, ""},
         {",80,,", {80}, ""},
@@ -51,14 +48,14 @@ TEST_F(Relay, PortListsAreReadInTheirOrder) {
         {"9,8-65536", {9}, "invalid port range [8-65536]"},
         {"4294967376-4294967377", {}, "invalid port range [2147483647-2147483647]"},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [szText, rgRead, szLine] : rgCases) {
         gLog.clear();
         std::list<int> ports = {1};
-        EXPECT_EQ(TLibParsePorts(ports, c.szText), *c.szLine == '\0' ? 0 : -1) << c.szText;
+        EXPECT_EQ(TLibParsePorts(ports, szText), *szLine == '\0' ? 0 : -1) << szText;
         EXPECT_EQ(ports.front(), 1);
         ports.pop_front();
-        EXPECT_EQ(Ports(ports.begin(), ports.end()), c.ports) << c.szText;
-        EXPECT_EQ(gLog, *c.szLine == '\0' ? Lines{} : Lines{c.szLine});
+        EXPECT_EQ(Ports(ports.begin(), ports.end()), rgRead) << szText;
+        EXPECT_EQ(gLog, *szLine == '\0' ? Lines{} : Lines{szLine});
     }
     std::list<int> ports;
     EXPECT_EQ(TLibParsePorts(ports, nullptr), -1);
@@ -389,25 +386,23 @@ TEST_F(Relay, APassThatFailsEndsTheMerge) {
 
 // What the passes never ask: the name turns rules away before a filter that wants nothing is met.
 TEST_F(Relay, AFilterThatWantsNothing) {
-    const struct {
-        RULE_FILTER filter;
-        const char* szOut;  // of "E hop", "D hop", "E web", "D web": '1' out, '0' in, 'x' cannot be judged
-    } rgCases[] = {
+    // szWanted: of "E hop", "D hop", "E web", "D web": '1' out, '0' in, 'x' cannot be judged.
+    const std::pair<RULE_FILTER, const char*> rgCases[] = {
         {{nullptr, true, false, false}, "xxxx"},
         {{"hop", true, false, false}, "xx11"},
         {{"hop", false, false, false}, "11xx"},
         {{"Hop", true, true, true}, "1111"},
     };
     const Set rules("E tcp hop 1>1;D tcp hop 1>1;E tcp web 1>1;D tcp web 1>1");
-    for (const auto& c : rgCases) {
+    for (const auto& [filter, szWanted] : rgCases) {
         gLog.clear();
         std::string szOut;
         for (int i = 0; i < rules.nRules; ++i) {
             bool blOut = false;
-            const int nResult = IsNeedToFilterOut(Host(), &blOut, rules.rgRules[i], &c.filter);
+            const int nResult = IsNeedToFilterOut(Host(), &blOut, rules.rgRules[i], &filter);
             szOut += nResult == -1 ? 'x' : blOut ? '1' : '0';
         }
-        EXPECT_EQ(szOut, c.szOut);
+        EXPECT_EQ(szOut, szWanted);
         const auto nLines = static_cast<size_t>(std::count(szOut.begin(), szOut.end(), 'x'));
         EXPECT_EQ(gLog, Lines(nLines,
                               "Bad parameter, blMatchEnabledRules and blMatchDisabledRules shall not both be "

@@ -412,13 +412,8 @@ TEST_F(RelayService, ClassifiesTheRouterOnce) {
     const auto fnInTheWay = [](const std::string& szPath) {
         return [=] { std::filesystem::create_directories(szPath + "/x"); };
     };
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnSetUp;
-        int nResult;
-        std::string szLines;  // the last ones
-        const char* szKnown;
-    } rgCases[] = {
+    // szLines: the last ones.
+    const std::tuple<const char*, std::function<void()>, int, std::string, const char*> rgCases[] = {
         {"known by its settings", Settings("no", "yes"), 0, szDone + "upnp/natpmp", "settings no yes;"},
         {"manual by its settings", Settings("no", "no"), 1, szManual, "settings no no;"},
         {"manual by the cache", [] { SetDetectManualCache("192.168.1.1", "a", "b", "c"); }, 1, szManual,
@@ -447,18 +442,18 @@ TEST_F(RelayService, ClassifiesTheRouterOnce) {
         {"no cache written", All(fnUnknown, fnBroken, fnInTheWay(SZF_DETECT_MANUAL_CACHE)), -1,
          "Sync() failed\nset detect cache failed", "tested no -1"},
     };
-    for (const auto& c : rgCases) {
-        SCOPED_TRACE(c.szWhat);
+    for (const auto& [szWhat, fnSetUp, nWanted, szLines, szKnown] : rgCases) {
+        SCOPED_TRACE(szWhat);
         TearDown();
         SetUp();
         std::filesystem::remove(kRouterConf);
-        c.fnSetUp();
+        fnSetUp();
         gLog.clear();
         const int nResult = TLibTavoPortMapRouterDetect();
-        EXPECT_EQ(nResult, c.nResult);
+        EXPECT_EQ(nResult, nWanted);
         std::erase_if(gLog, [](const std::string& szLine) { return szLine.starts_with("> "); });
-        EXPECT_EQ(LastLines(c.szLines), c.szLines);
-        EXPECT_EQ(Known(), c.szKnown);
+        EXPECT_EQ(LastLines(szLines), szLines);
+        EXPECT_EQ(Known(), szKnown);
         EXPECT_EQ(LockIsFree(), nResult != 2);
         if (nResult == 2) {
             TLibTavoPortMapUnLock();
@@ -496,38 +491,33 @@ TEST_F(RelayService, TheDetectionsChildComesBackWithoutTheLock) {
 
 TEST_F(RelayService, PrintedTestsAndSets) {
     const std::string szRead = "service name=hop\nports:80 szProtocol:tcp\nports:81-82 szProtocol:udp\n";
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnSpoil;
-        int (*pfnCall)(const char*);
-        const char* szRequest;
-        int nResult;
-        std::string szPrinted;
-        const char* szKept;
-    } rgCases[] = {
-        {"test", [] {}, &TestFuncTestRules, "hop;80;tcp;81-82;udp", 0,
-         szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n", ""},
-        {"no tester", [this] { mClient.mapAnswers["init"] = -1; }, &TestFuncTestRules, "hop;80;tcp;81-82;udp", -1,
-         szRead, ""},
-        {"no port", [] {}, &TestFuncTestRules, "hop;x;tcp", -1,
-         "service name=hop\nports:x szProtocol:tcp\nCreateOperationRulesArray(rgRules) failed\n", ""},
-        {"nothing to test", [] {}, &TestFuncTestRules, "hop", -1, "service name=hop\n", ""},
-        {"set", [] {}, &TestFuncSetRules, "hop;80;tcp;81-82;udp", 0,
-         szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n", "1 E tcp 80 80 hop; 2 E udp 81-82 81-82 hop"},
-        {"never detected", [] { std::filesystem::remove(kRouterConf); }, &TestFuncSetRules, "hop;80;tcp;81-82;udp", 0,
-         szRead + "router_ports [80]=not test\nrouter_ports [81-82]=not test\n", ""},
-        {"refused", [this] { mNetwork.nUpnpInit = 1; }, &TestFuncSetRules, "hop;80;tcp;81-82;udp", -1,
-         szRead + "TLibTavoPortMapRulesSet() failed\n", ""},
-        {"no protocol", [] {}, &TestFuncSetRules, "hop;80", -1, "service name=hop\nports:80 szProtocol:NULL\n", ""},
-    };
-    for (const auto& c : rgCases) {
-        SCOPED_TRACE(c.szWhat);
+    const std::tuple<const char*, std::function<void()>, decltype(&TestFuncTestRules), const char*, int, std::string,
+                     const char*>
+        rgCases[] = {
+            {"test", [] {}, &TestFuncTestRules, "hop;80;tcp;81-82;udp", 0,
+             szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n", ""},
+            {"no tester", [this] { mClient.mapAnswers["init"] = -1; }, &TestFuncTestRules, "hop;80;tcp;81-82;udp", -1,
+             szRead, ""},
+            {"no port", [] {}, &TestFuncTestRules, "hop;x;tcp", -1,
+             "service name=hop\nports:x szProtocol:tcp\nCreateOperationRulesArray(rgRules) failed\n", ""},
+            {"nothing to test", [] {}, &TestFuncTestRules, "hop", -1, "service name=hop\n", ""},
+            {"set", [] {}, &TestFuncSetRules, "hop;80;tcp;81-82;udp", 0,
+             szRead + "router_ports [80]=ok\nrouter_ports [81-82]=fail\n",
+             "1 E tcp 80 80 hop; 2 E udp 81-82 81-82 hop"},
+            {"never detected", [] { std::filesystem::remove(kRouterConf); }, &TestFuncSetRules, "hop;80;tcp;81-82;udp",
+             0, szRead + "router_ports [80]=not test\nrouter_ports [81-82]=not test\n", ""},
+            {"refused", [this] { mNetwork.nUpnpInit = 1; }, &TestFuncSetRules, "hop;80;tcp;81-82;udp", -1,
+             szRead + "TLibTavoPortMapRulesSet() failed\n", ""},
+            {"no protocol", [] {}, &TestFuncSetRules, "hop;80", -1, "service name=hop\nports:80 szProtocol:NULL\n", ""},
+        };
+    for (const auto& [szWhat, fnSpoil, pfnCall, szRequest, nResult, szPrinted, szKept] : rgCases) {
+        SCOPED_TRACE(szWhat);
         SetUp();
-        c.fnSpoil();
+        fnSpoil();
         testing::internal::CaptureStdout();
-        EXPECT_EQ(c.pfnCall(c.szRequest), c.nResult);
-        EXPECT_EQ(testing::internal::GetCapturedStdout(), c.szPrinted);
-        EXPECT_EQ(Kept(), c.szKept);
+        EXPECT_EQ(pfnCall(szRequest), nResult);
+        EXPECT_EQ(testing::internal::GetCapturedStdout(), szPrinted);
+        EXPECT_EQ(Kept(), szKept);
     }
     EXPECT_EQ(TestFuncTestRules(nullptr), -1);
     EXPECT_EQ(TestFuncSetRules(nullptr), -1);

@@ -448,39 +448,34 @@ void SetDetected(const char* szBrand) {
 
 std::string gSzAtSignal;  // the router settings when the signal came
 
-struct ReportCase {
-    const char* szBrand;
-    const char* szArchive;  // before "_SECONDS.tgz"
-    bool blSettings;
-    int nCurl;
-};
-
 TEST_F(RouterTests, ReportArchivesAndPutsTheSettingsBack) {
-    const ReportCase rgCases[] = {{"Acme (EU) R-1+", "Acme (EU) R-1+", true, 0},
-                                  {"x'; touch /tmp/owned; '", "x__ touch _tmp_owned_ _", true, 0},
-                                  {"../../etc/x", ".._.._etc_x", false, 0},
-                                  {"..", "upnpresult", true, 0},
-                                  {"", "upnpresult", true, 1}};
+    // Brand, archive before "_SECONDS.tgz", whether there are settings, and what the upload ends with.
+    const std::tuple<const char*, const char*, bool, int> rgCases[] = {
+        {"Acme (EU) R-1+", "Acme (EU) R-1+", true, 0},
+        {"x'; touch /tmp/owned; '", "x__ touch _tmp_owned_ _", true, 0},
+        {"../../etc/x", ".._.._etc_x", false, 0},
+        {"..", "upnpresult", true, 0},
+        {"", "upnpresult", true, 1}};
     for (const char* szFile : {kProgress, "/var/tmp/upnp_portmap.status", "/var/log/router.log", "/tmp/pfStatusRule"}) {
         Write(szFile, "a=\"b\"\n");
     }
-    for (const ReportCase& report : rgCases) {
-        SCOPED_TRACE(report.szBrand);
-        SetDetected(report.szBrand);
+    for (const auto& [szBrand, szName, blSettings, nCurl] : rgCases) {
+        SCOPED_TRACE(szBrand);
+        SetDetected(szBrand);
         std::filesystem::remove("/etc/portforward/router.conf");
-        if (report.blSettings) {
+        if (blSettings) {
             Write("/etc/portforward/router.conf", "[10.0.0.1]\nbrand=mine\n");
         }
         WriteProgram("/usr/tavo/bin/curl",
-                     "printf '%s\\n' \"$@\" > /tmp/curl.args\nexit " + std::to_string(report.nCurl) + "\n");
+                     "printf '%s\\n' \"$@\" > /tmp/curl.args\nexit " + std::to_string(nCurl) + "\n");
         std::filesystem::remove("/tmp/curl.args");
-        EXPECT_EQ(TLibUploadTestUpnpCompatibilityFailResult(), report.nCurl == 0 ? 0 : -1);
-        EXPECT_EQ(Logged("update upnp router info failed"), report.nCurl != 0);
+        EXPECT_EQ(TLibUploadTestUpnpCompatibilityFailResult(), nCurl == 0 ? 0 : -1);
+        EXPECT_EQ(Logged("update upnp router info failed"), nCurl != 0);
 
         const std::string szArgs = Read("/tmp/curl.args");
         const size_t nStart = szArgs.find("uploadedfile=@") + 14;
         const std::string szArchive = szArgs.substr(nStart, szArgs.find(';', nStart) - nStart);
-        const std::string szStem = std::string("/tmp/") + report.szArchive + "_";
+        const std::string szStem = std::string("/tmp/") + szName + "_";
         EXPECT_TRUE(szArchive.starts_with(szStem) && szArchive.ends_with(".tgz")) << szArchive;
         EXPECT_EQ(szArchive.find_first_not_of("0123456789", szStem.size()), szArchive.size() - 4) << szArchive;
         EXPECT_TRUE(szArgs.starts_with("--digest\n-u\ntavoreportuser:rtrsubmit417\n-F\n"));
@@ -493,8 +488,7 @@ TEST_F(RouterTests, ReportArchivesAndPutsTheSettingsBack) {
                   "etc/portforward/router.conf\ntmp/upnp_test.progress\nvar/tmp/upnp_portmap.status\n"
                   "var/log/router.log\ntmp/pfStatusRule\n");
         EXPECT_NE(Read("/tmp/sent").find("support_router_upnp=\"yes\""), std::string::npos);
-        EXPECT_EQ(Read("/etc/portforward/router.conf"),
-                  report.blSettings ? "[10.0.0.1]\nbrand=mine\n" : Read("/tmp/sent"));
+        EXPECT_EQ(Read("/etc/portforward/router.conf"), blSettings ? "[10.0.0.1]\nbrand=mine\n" : Read("/tmp/sent"));
         EXPECT_FALSE(std::filesystem::exists("/tmp/owned"));
         std::filesystem::remove(szArchive);
     }

@@ -91,15 +91,7 @@ TEST_F(Saving, TakesEveryStepInItsOrder) {
     const std::string szUpnp = "> exec /usr/tavo/sbin/upnpd";
     const std::string szNatpmp = "> exec /usr/tavo/sbin/natpmpd";
     const std::string szAlive = "\nupnp daemon is alive now\n> 90\nupnpd checking is done";
-    const struct {
-        const char* szNatpmp;
-        const char* szUpnp;
-        std::set<std::string> alive;
-        const char* szPid;
-        int nRules;
-        std::string szStory;
-        int nSlept;
-    } rgFlows[] = {
+    const std::tuple<const char*, const char*, std::set<std::string>, const char*, int, std::string, int> rgFlows[] = {
         {"yes",
          "yes",
          {"upnpd"},
@@ -115,20 +107,20 @@ TEST_F(Saving, TakesEveryStepInItsOrder) {
         {"Yes", "YES", {}, "", 1, kToolRun, 3},
         {"no", "unknown", {}, "", 0, kToolRun, 3},
     };
-    for (const auto& flow : rgFlows) {
+    for (const auto& [szNatpmpWord, szUpnpWord, alive, szPid, nRules, szSteps, nSlept] : rgFlows) {
         Reset(3);
-        Router(flow.szNatpmp, flow.szUpnp);
+        Router(szNatpmpWord, szUpnpWord);
         Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
         Write("/var/tmp/natpmp_portmap.remap", "");
-        Write("/var/run/upnpd.pid", flow.szPid);
-        gStage.alive = flow.alive;
+        Write("/var/run/upnpd.pid", szPid);
+        gStage.alive = alive;
         mResult.nStatus = 77;
-        EXPECT_EQ(Save(flow.nRules), 0);
-        const std::string szStory = szBegin + flow.szStory + szEnd;
+        EXPECT_EQ(Save(nRules), 0);
+        const std::string szStory = szBegin + szSteps + szEnd;
         EXPECT_EQ(LastLines(szStory + "\n"), szStory) << "and nothing before it";
-        EXPECT_EQ(gNSlept, flow.nSlept);
+        EXPECT_EQ(gNSlept, nSlept);
         EXPECT_EQ(mResult.nStatus, 0);
-        EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), flow.nRules == 0 ? 0 : 1);
+        EXPECT_EQ(RouterRuleConfReader(false).StartNextRule(), nRules == 0 ? 0 : 1);
     }
     Reset();
     gStage.blRelay = false;
