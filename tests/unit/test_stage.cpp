@@ -37,6 +37,15 @@ void Tell(const std::string& szLine) {
 
 namespace {
 
+template <typename... Words>
+int Told(const Words&... words) {
+    const OwnMemory own;
+    std::ostringstream line;
+    ((line << words), ...);
+    Tell(line.str());
+    return 0;
+}
+
 bool Fails(const char* szCall) {
     return gStage.blOn && gStage.szFail == szCall && gStage.nWorks-- <= 0;
 }
@@ -60,8 +69,7 @@ int TLIBCSzHashSetValue(TLIBCSzHash* pHash, const char* szKey, const char* szVal
 }
 int TLIBCFileSetKeyValue(const char* szPath, const char* szKey, const char* szValue, const char* szFormat) {
     if (gStage.blOn) {
-        const OwnMemory own;
-        Tell(std::string(szKey) + "=" + szValue);
+        Told(szKey, "=", szValue);
     }
     return Fails("run key") ? -1
                             : Real("TLIBCFileSetKeyValue", &TLIBCFileSetKeyValue)(szPath, szKey, szValue, szFormat);
@@ -82,8 +90,7 @@ int TAVOPFCountJobNumber(const TAVO_PF_CONF* pHead, const char* szGwRouterIP, co
 }
 int TAVOPFRuleBuildByPath(const TAVO_PF_CONF* pHead, const char* szPath) {
     if (gStage.blOn) {
-        const OwnMemory own;
-        Tell("write " + std::string(szPath));
+        Told("write ", szPath);
     }
     return Fails("write") ? -1 : Real("TAVOPFRuleBuildByPath", &TAVOPFRuleBuildByPath)(pHead, szPath);
 }
@@ -104,19 +111,13 @@ int TLIBCIsProcAlive(const char* szName) {
     return gStage.alive.contains(szName) ? 1 : 0;
 }
 int TLIBCKill(const char* szName, int nSignal) {
-    if (!gStage.blOn) {
-        return Real("TLIBCKill", &TLIBCKill)(szName, nSignal);
-    }
-    const OwnMemory own;
-    Tell("signal " + std::string(szName) + " " + std::to_string(nSignal));
-    return 1;
+    return gStage.blOn ? Told("signal ", szName, " ", nSignal) + 1 : Real("TLIBCKill", &TLIBCKill)(szName, nSignal);
 }
 int kill(pid_t pid, int nSignal) noexcept {
     if (!gStage.blOn || pid < 0) {
         return Real("kill", &kill)(pid, nSignal);
     }
-    const OwnMemory own;
-    Tell("kill " + std::to_string(pid) + " " + std::to_string(nSignal));
+    Told("kill ", pid, " ", nSignal);
     errno = ESRCH;
     return Fails("kill") ? -1 : 0;
 }
@@ -125,7 +126,7 @@ int TLIBCExec(const char* szPath, const char* szArg1, const char* szArg2, const 
         return Real("TLIBCExec", &TLIBCExec)(szPath, szArg1, szArg2, szArg3, szArg4);
     }
     const OwnMemory own;
-    Tell("exec " + std::string(szPath));
+    Told("exec ", szPath);
     if (Fails("exec")) {
         return -1;
     }
@@ -139,7 +140,7 @@ int TLIBCSystem(const char* szCommand) {
         return Real("TLIBCSystem", &TLIBCSystem)(szCommand);
     }
     const OwnMemory own;
-    Tell("run " + std::string(szCommand));
+    Told("run ", szCommand);
     if (Fails("run")) {
         return -1;
     }
@@ -150,30 +151,18 @@ int TLIBCSystem(const char* szCommand) {
 }
 int TAVOLogSet1(int nKind, int nLevel, unsigned nEvent, const char* szText1, const char* szText2, const char* szText3,
                 const char* szText4) {
-    if (!gStage.blOn) {
-        return Real("TAVOLogSet1", &TAVOLogSet1)(nKind, nLevel, nEvent, szText1, szText2, szText3, szText4);
-    }
-    const OwnMemory own;
-    std::ostringstream line;
-    line << "event " << nKind << " " << nLevel << " " << std::hex << nEvent << " " << szText1 << "|" << szText2 << "|"
-         << szText3 << "|" << szText4;
-    Tell(line.str());
-    return 0;
+    return gStage.blOn ? Told("event ", nKind, " ", nLevel, " ", std::hex, nEvent, " ", szText1, "|", szText2, "|",
+                              szText3, "|", szText4)
+                       : Real("TAVOLogSet1", &TAVOLogSet1)(nKind, nLevel, nEvent, szText1, szText2, szText3, szText4);
 }
 int TLIBServiceIsRunning(const char* szName) {
     if (!gStage.blOn) {
         return Real("TLIBServiceIsRunning", &TLIBServiceIsRunning)(szName);
     }
-    const OwnMemory own;
-    Tell("ask " + std::string(szName) + (IsLockFree() ? "" : ", still locked"));
+    Told("ask ", szName, IsLockFree() ? "" : ", still locked");
     return gStage.blRelay ? 1 : 0;
 }
 int TLIBServiceReload(const char* szName) {
-    if (!gStage.blOn) {
-        return Real("TLIBServiceReload", &TLIBServiceReload)(szName);
-    }
-    const OwnMemory own;
-    Tell("reload " + std::string(szName));
-    return 0;
+    return gStage.blOn ? Told("reload ", szName) : Real("TLIBServiceReload", &TLIBServiceReload)(szName);
 }
 }
