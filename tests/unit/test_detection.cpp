@@ -311,7 +311,7 @@ void NoteProgress(const DetectResult* pResult, void* pData) {
 TEST_F(Detection, DriverInEachNetwork) {
     const auto fnBadModel = [this] { mNetwork.model = TAVO_UPNP_GATEWAY_MODEL{"Bad", "R", "1"}; };
     const std::vector<int> rgAll = {10, 20, 30, 40, 70, 50, 80, 80};
-    // nSteps: of those; where it ends before, the last one is told twice.
+    // With how many of those there are: where it ends before, the last one is told twice.
     const std::tuple<const char*, std::function<void()>, size_t, int, int, int, int, const char*> rgCases[] = {
         {"all is well", [] {}, 8, 0, 0, 0, 32, "All network env checks are pass"},
         {"no interface", [this] { mNetwork.nInterface = -1; }, 2, -1, 0, 0, 0, "Network interface is not enabled"},

@@ -102,7 +102,7 @@ TEST_F(Library, RuleArrays) {
 
 TEST_F(Library, RuleFilesThatCannotBeConverted) {
     const std::string szPorts = "s_port=1\nr_port=2\n";
-    // nTold: on failure the count keeps the number of sections.
+    // On failure the count keeps the number of sections.
     const std::tuple<std::string, int, std::vector<std::string>> rgCases[] = {
         {"[1]\n" + szPorts + "protocol name=tcp\n", 1, {"get rule enable failed", "IsRuleEnable() failed"}},
         {"[1]\n[2]\n[3]\n", 3, {"section shall not be empty", "IsRuleEnable() failed"}},
@@ -623,7 +623,7 @@ TEST_F(Library, CompatibilityDatabaseOfTwoFiles) {
 
 // What the settings of a router say, as each of its readers tells it: the words, "yes" or not, and what it can do.
 TEST_F(Library, SettingsThatAreThereAndThatAreNot) {
-    // szTold: UPnP, NAT-PMP, whether each is "yes", and the limit; "-": not told.
+    // Told are UPnP, NAT-PMP, whether each is "yes", and the limit; "-" is what is not told.
     const std::tuple<const char*, const char*, const char*, int> rgCases[] = {
         {"192.168.1.1", "support_router_upnp=yes\nsupport_router_natpmp=no\nmax=5\n", "yes no 1 0 5", 0},
         {"192.168.1.1", "support_router_upnp=no\nsupport_router_natpmp=unknown\n", "no unknown 0 0 -", 0},

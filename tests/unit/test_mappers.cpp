@@ -232,7 +232,7 @@ TEST_F(NatpmpMapping, WhatLedToAFormerAddressIsTakenAwayFromThereOrWaitedFor) {
 
 // Leases run by the clock of the boot, as the router's do.
 TEST_F(NatpmpMapping, AClockThatIsSetChangesNothing) {
-    // blBoth: rules; else the first.
+    // With both rules or the first one alone.
     const Lines both{kAsked[0], "8081 at 81 for 3600"};
     const std::tuple<int, bool, bool, Lines> rgCases[] = {{0, true, true, both},
                                                           {7200, true, false, {}},

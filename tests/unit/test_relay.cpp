@@ -25,7 +25,7 @@ using Relay = StagedTest;
 // ---- port lists ---------------------------------------------------------------------------------------
 
 TEST_F(Relay, PortListsAreReadInTheirOrder) {
-    // szLine: what a failure logs; empty: success.
+    // With the line that a failure logs.
     const std::tuple<const char*, Ports, const char*> rgCases[] = {
         {"80", {80}, ""},
         {"80,443", {80, 443}, ""},
@@ -334,7 +334,7 @@ TEST_F(Relay, AnObserverIsToldOfEachPairThatGoesAndOfWhatFails) {
         std::string mSzTold;
     };
     const UsedPorts used{{2}, {3}};
-    // szOthers: null: the ports that other hosts hold.
+    // Against rules of others, or against the ports that other hosts hold.
     const std::tuple<const char*, const char*, int, const char*> rgCases[] = {
         {"E tcp hop 1-3>5-7", nullptr, 0, "hop 2>6 -; "},
         {"E udp hop 1-3>5-7;E all web 2,3,2>7-9", nullptr, 0, "hop 3>7 -; web 2>9 -; web 2>7 -; "},
@@ -386,7 +386,7 @@ TEST_F(Relay, APassThatFailsEndsTheMerge) {
 
 // What the passes never ask: the name turns rules away before a filter that wants nothing is met.
 TEST_F(Relay, AFilterThatWantsNothing) {
-    // szWanted: of "E hop", "D hop", "E web", "D web": '1' out, '0' in, 'x' cannot be judged.
+    // Of "E hop", "D hop", "E web", "D web": '1' is out, '0' is in, 'x' cannot be judged.
     const std::pair<RULE_FILTER, const char*> rgCases[] = {
         {{nullptr, true, false, false}, "xxxx"},
         {{"hop", true, false, false}, "xx11"},

@@ -412,7 +412,7 @@ TEST_F(RelayService, ClassifiesTheRouterOnce) {
     const auto fnInTheWay = [](const std::string& szPath) {
         return [=] { std::filesystem::create_directories(szPath + "/x"); };
     };
-    // szLines: the last ones.
+    // With the last lines of the log.
     const std::tuple<const char*, std::function<void()>, int, std::string, const char*> rgCases[] = {
         {"known by its settings", Settings("no", "yes"), 0, szDone + "upnp/natpmp", "settings no yes;"},
         {"manual by its settings", Settings("no", "no"), 1, szManual, "settings no no;"},

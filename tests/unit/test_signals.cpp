@@ -23,7 +23,7 @@ namespace {
 TEST(SignalQueue, WhatAQuestionTookInEndsTheNextWaitAndNoFurtherOne) {
     constexpr int kLongMilliseconds = 20000;
     using Question = bool (tavo::SignalQueue::*)();
-    // pfnAsked: takes the signal in, and is about another one.
+    // The first question takes the signal in, and is about another one.
     const std::tuple<int, Question, Question> rgCases[] = {
         {SIGTERM, &tavo::SignalQueue::HasRequest, &tavo::SignalQueue::IsStop},
         {SIGUSR1, &tavo::SignalQueue::TakeRequest, &tavo::SignalQueue::IsHandOver},
