@@ -157,31 +157,28 @@ TEST_F(Faults, AFullDiskLosesNothing) {
 
 TEST_F(Faults, CopiesOfKilledWritersComeBackOrGo) {
     // Name of the copy, its age against the live file in seconds, and whether it goes once it is obsolete.
-    const struct {
-        const char* szName;
-        int nOlder;
-        bool blGoes;
-    } rgCopies[] = {{"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zc", 1, true},    {"rule.conf1a2b3c", 60, false},
-                    {"rule.confaB3dE7", 60, false}, {"rule.confv1B2c3", 60, false},  {"rule.confN3wEr4", -60, false},
-                    {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false},  {"rule.confNov25a", 60, false},
-                    {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false}, {"rule.confbackup", 60, false},
-                    {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},  {"rule.confaB3dE", 60, false},
-                    {"rule.confaB3dE67", 60, false}};
+    const std::tuple<const char*, int, bool> rgCopies[] = {
+        {"rule.confaB3dE6", 60, true},  {"rule.confZ0z0Zc", 1, true},    {"rule.conf1a2b3c", 60, false},
+        {"rule.confaB3dE7", 60, false}, {"rule.confv1B2c3", 60, false},  {"rule.confN3wEr4", -60, false},
+        {"rule.confBackup", 60, false}, {"rule.confOld001", 60, false},  {"rule.confNov25a", 60, false},
+        {"rule.conf.aB3dE6", 60, true}, {"rule.conf.Backup", 60, false}, {"rule.confbackup", 60, false},
+        {"rule.conf202611", 60, false}, {"rule.conf.saved", 60, false},  {"rule.confaB3dE", 60, false},
+        {"rule.confaB3dE67", 60, false}};
     Write(kRuleConf, kOldRules);
     symlink("/etc/portforward/rule.conf.saved", "/etc/portforward/rule.confaBcDe5");
-    for (const auto& copy : rgCopies) {
-        const std::string szPath = std::string(kDir) + "/" + copy.szName;
-        Write(szPath, std::string("[") + copy.szName + "]\nenabled=1\n");
-        std::filesystem::last_write_time(
-            szPath, std::filesystem::last_write_time(kRuleConf) - std::chrono::seconds(copy.nOlder));
+    for (const auto& [szName, nOlder, blGoes] : rgCopies) {
+        const std::string szPath = std::string(kDir) + "/" + szName;
+        Write(szPath, std::string("[") + szName + "]\nenabled=1\n");
+        std::filesystem::last_write_time(szPath,
+                                         std::filesystem::last_write_time(kRuleConf) - std::chrono::seconds(nOlder));
     }
     const Lines rgszAll = Names();
     EXPECT_EQ(CountRules(), 1);
     EXPECT_EQ(Names(), rgszAll) << "a writer may be at work";
     gNClockAhead = 3600;
     EXPECT_EQ(CountRules(), 1);
-    for (const auto& copy : rgCopies) {
-        EXPECT_EQ(std::filesystem::exists(std::string(kDir) + "/" + copy.szName), !copy.blGoes) << copy.szName;
+    for (const auto& [szName, nOlder, blGoes] : rgCopies) {
+        EXPECT_EQ(std::filesystem::exists(std::string(kDir) + "/" + szName), !blGoes) << szName;
     }
     EXPECT_TRUE(std::filesystem::is_symlink("/etc/portforward/rule.confaBcDe5"));
     EXPECT_EQ(Read(kRuleConf), kOldRules);
@@ -266,26 +263,23 @@ void KnowTheRouter(int nToolVersion = 1) {
 // What a call does to the settings, wherever in it the process is killed.
 TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
     const auto fnSet = [](const char* szUpnp) { return [=] { SetSettings(szUpnp); }; };
-    const struct {
-        const char* szWhat;
-        std::function<void()> fnCall;
-        int nToolVersion = 1;
-        bool blMayBeNew = true;
-    } rgCalls[] = {{"a UPnP router", fnSet("yes")},
-                   {"a router of pages", fnSet("no")},
-                   {"one whose settings cannot be used", fnSet("no"), 0},
-                   {"a report", SendReport, 1, false}};
-    for (const auto& call : rgCalls) {
+    // With the version of the tool, and whether the new settings may be there.
+    const std::tuple<const char*, std::function<void()>, int, bool> rgCalls[] = {
+        {"a UPnP router", fnSet("yes"), 1, true},
+        {"a router of pages", fnSet("no"), 1, true},
+        {"one whose settings cannot be used", fnSet("no"), 0, true},
+        {"a report", SendReport, 1, false}};
+    for (const auto& [szWhat, fnCall, nToolVersion, blMayBeNew] : rgCalls) {
         int nKilled = 0;
         for (bool blKilled = true; blKilled && nKilled < 100; nKilled += blKilled ? 1 : 0) {
             SetUp();
-            KnowTheRouter(call.nToolVersion);
+            KnowTheRouter(nToolVersion);
             Write(kRouterConf, kOldSettings);
             MakeOlder(kRouterConf, 60);
             const pid_t pid = fork();
             if (pid == 0) {
                 gNGoodChanges = nKilled;
-                call.fnCall();
+                fnCall();
                 _exit(0);
             }
             int nStatus = 0;
@@ -297,16 +291,16 @@ TEST_F(Faults, SettingsOutliveAWriterThatIsKilledAnywhere) {
                 auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
                 const bool blRead = TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true) == 0;
                 const std::string szBrand = blRead ? pConf->szBrand : "nothing";
-                EXPECT_TRUE(szBrand == "Old" || (call.blMayBeNew && szBrand == "Acme"))
-                    << call.szWhat << ", killed at change " << nKilled << ", " << nAhead << " s later: " << szBrand;
+                EXPECT_TRUE(szBrand == "Old" || (blMayBeNew && szBrand == "Acme"))
+                    << szWhat << ", killed at change " << nKilled << ", " << nAhead << " s later: " << szBrand;
                 EXPECT_TRUE(tavo::lib::GetInitState(&enState) == 0 && enState >= TAVO_ROUTER_INIT_STATE_UPNP_NATPMP);
             }
             Lines rgszLeft = Names();
             std::erase(rgszLeft, "router.conf.bak");  // a person may have made that
-            EXPECT_EQ(rgszLeft, (Lines{"router.conf", "router_upnp.db"})) << call.szWhat << " " << nKilled;
+            EXPECT_EQ(rgszLeft, (Lines{"router.conf", "router_upnp.db"})) << szWhat << " " << nKilled;
             gNClockAhead = 0;
         }
-        EXPECT_GT(nKilled, 2) << call.szWhat;
+        EXPECT_GT(nKilled, 2) << szWhat;
     }
 }
 
@@ -382,32 +376,29 @@ TEST_F(Faults, AForeignLockOnTheSettingsHindersNobody) {
 
 TEST_F(Faults, WhatAReportSetAsideComesBackUnlessSomebodyHasWrittenSince) {
     const std::string szHand = "[192.168.1.1]\nbrand=Hand\nsupport_router_upnp=no\nsupport_router_natpmp=no\n";
-    const struct {
-        const char* szCopy;
-        int nLater;  // seconds from then to what stands in the settings' place now
-        const char* szBrand;
-        bool blGoes;  // the copy, an hour later
-    } rgCases[] = {{"3aB4cP", 0, "Old", true},
-                   {"3aB4cP", 60, "Hand", true},
-                   {"1a2b3c", 0, "Hand", false},
-                   {"3aB4cD", 0, "Hand", false}};
-    for (const auto& one : rgCases) {
+    // The copy's suffix, seconds from then to what stands in the settings' place now, whose settings are read, and
+    // whether the copy goes an hour later.
+    const std::tuple<const char*, int, const char*, bool> rgCases[] = {{"3aB4cP", 0, "Old", true},
+                                                                       {"3aB4cP", 60, "Hand", true},
+                                                                       {"1a2b3c", 0, "Hand", false},
+                                                                       {"3aB4cD", 0, "Hand", false}};
+    for (const auto& [szSuffix, nLater, szBrand, blGoes] : rgCases) {
         SetUp();
-        const std::string szCopy = kRouterConf + std::string(one.szCopy);
+        const std::string szCopy = kRouterConf + std::string(szSuffix);
         Write(szCopy, kOldSettings);
         Write(kRouterConf, szHand);
         std::filesystem::last_write_time(kRouterConf,
-                                         std::filesystem::last_write_time(szCopy) + std::chrono::seconds(one.nLater));
+                                         std::filesystem::last_write_time(szCopy) + std::chrono::seconds(nLater));
         for (const time_t nAhead : {0, 3600, 7200}) {
             gNClockAhead = nAhead;
             const auto pConf = std::make_unique<RouterConf>();
             EXPECT_EQ(TLibGetRouterConf("192.168.1.1", pConf.get(), nullptr, true), 0);
-            EXPECT_STREQ(pConf->szBrand, one.szBrand) << one.szCopy << " " << one.nLater;
+            EXPECT_STREQ(pConf->szBrand, szBrand) << szSuffix << " " << nLater;
         }
         gNClockAhead = 0;
-        EXPECT_EQ(std::filesystem::exists(szCopy), !one.blGoes) << one.szCopy << " " << one.nLater;
+        EXPECT_EQ(std::filesystem::exists(szCopy), !blGoes) << szSuffix << " " << nLater;
         EXPECT_EQ(std::any_of(gLog.begin(), gLog.end(), [](auto& szLine) { return szLine.find("killed") + 1 != 0; }),
-                  one.blGoes);
+                  blGoes);
     }
 }
 
