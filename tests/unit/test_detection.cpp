@@ -492,46 +492,41 @@ TEST_F(Detection, SettingsAfterEachFault) {
     };
     const auto fnNoWrite = [](RouterConf&) { gFnOnConfSet = [] { return -1; }; };
     const auto fnNoUpnpWrite = [&](RouterConf& conf) { conf = MakeConf("yes", "no"), fnNoWrite(conf); };
-    const struct {
-        const char* szWhat;
-        std::function<void(RouterConf&)> fnBreak;
-        const char* szLine;
-        int nErr = 1;
-    } rgFaults[] = {
+    const std::tuple<const char*, std::function<void(RouterConf&)>, const char*, int> rgFaults[] = {
         {"no support word", [](RouterConf& conf) { conf.szSupportNatpmp[0] = '\0'; },
-         "support_natpmp shall not be empty"},
-        {"no connection type", [](RouterConf& conf) { conf.szConnType[0] = '\0'; }, "conntype shall not be empty"},
-        {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty"},
-        {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed"},
-        {"a type that cannot be kept", fnFail("conn_type"), "save config failed"},
-        {"a port that cannot be kept", fnFail("conn_port"), "save config failed"},
-        {"a word of UPnP that cannot be kept", fnFail("support_router_upnp"), "save support upnp failed"},
-        {"a word of NAT-PMP that cannot be kept", fnFail("support_router_natpmp"), "save support natpmp failed"},
+         "support_natpmp shall not be empty", 1},
+        {"no connection type", [](RouterConf& conf) { conf.szConnType[0] = '\0'; }, "conntype shall not be empty", 1},
+        {"no port", [](RouterConf& conf) { conf.szConnPort[0] = '\0'; }, "connport shall not be empty", 1},
+        {"no gateway", [](RouterConf&) { gSzGateway.clear(); }, "save config failed", 1},
+        {"a type that cannot be kept", fnFail("conn_type"), "save config failed", 1},
+        {"a port that cannot be kept", fnFail("conn_port"), "save config failed", 1},
+        {"a word of UPnP that cannot be kept", fnFail("support_router_upnp"), "save support upnp failed", 1},
+        {"a word of NAT-PMP that cannot be kept", fnFail("support_router_natpmp"), "save support natpmp failed", 1},
         {"no backup copy", [](RouterConf&) { gSzFailRename = kRouterConf; },
-         "can not save backup file of '/etc/portforward/router.conf.bak'"},
-        {"failed write", fnNoWrite, "sync config failed"},
+         "can not save backup file of '/etc/portforward/router.conf.bak'", 1},
+        {"failed write", fnNoWrite, "sync config failed", 1},
         {"no description", [](RouterConf&) { std::filesystem::remove_all("/etc.defaults/portforward/routerdb/Acme"); },
-         "can not get router syntax version"},
+         "can not get router syntax version", 1},
         {"old tool", [](RouterConf&) { SetTool("syntax version=0"); },
          "syntax version and routerdb version is mis-mtached", 6},
-        {"UPnP router, failed write", fnNoUpnpWrite, "sync config failed"},
+        {"UPnP router, failed write", fnNoUpnpWrite, "sync config failed", 1},
         {"lock held", [](RouterConf&) { TLibTavoPortMapLock(); }, "PortForward conflict = /tmp/routerconf.lock", 2},
     };
-    for (const auto& fault : rgFaults) {
-        SCOPED_TRACE(fault.szWhat);
+    for (const auto& [szWhat, fnBreak, szLine, nErr] : rgFaults) {
+        SCOPED_TRACE(szWhat);
         SetUp();
         Write(kRouterConf, szOld);
         RouterConf conf = MakeConf("no", "no");
-        fault.fnBreak(conf);
+        fnBreak(conf);
         auto enErr = TAVO_LIBTAVOPORTMAP_ERR_NONE;
         EXPECT_EQ(TLibSetRouterConf("192.168.1.1", &conf, &enErr, true), -1);
-        EXPECT_TRUE(Logged(fault.szLine));
+        EXPECT_TRUE(Logged(szLine));
         EXPECT_EQ(Logged("can not get gateway ip"), gSzGateway.empty());
         EXPECT_EQ(Read(kRouterConf), *conf.szSupportUpnp == 'y' ? "" : szOld);
         EXPECT_FALSE(std::filesystem::exists(kRouterConfBak));
-        EXPECT_EQ(enErr, fault.nErr);
+        EXPECT_EQ(enErr, nErr);
         EXPECT_TRUE(gSzFailRename.empty());
-        if (fault.nErr == 2) {
+        if (nErr == 2) {
             TLibTavoPortMapUnLock();
         }
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));

@@ -41,35 +41,31 @@ std::unique_ptr<tavo::Igd> IgdAt(const std::shared_ptr<tavo::HttpTransport>& pHt
 
 TEST(Ssdp, AnAnswerLeadsToTheGatewayOrNowhere) {
     const auto fnAt = [](const std::string& szPlace) { return "HTTP/1.1 200 OK\r\nLOCATION: " + szPlace + "\r\n\r\n"; };
-    struct Case {
-        std::string szAnswer;
-        const char* szPlace;      // of the gateway's answer; empty: it leads nowhere
-        bool blAnybodys = false;  // it would count from another address, too
-    };
-    const Case rgCases[] = {
+    // Where the gateway's answer leads, if anywhere, and whether it would count from another address, too.
+    const std::tuple<std::string, const char*, bool> rgCases[] = {
         {"HTTP/1.1 200 OK\r\nLocation:http://192.168.1.1:5000/x\r\n\r\n", "http://192.168.1.1:5000/x", true},
         {fnAt("http://192.168.1.1:/x"), "http://192.168.1.1:80/x", true},
-        {fnAt("http://192.168.1.2:5000/x?y"), "http://192.168.1.1:5000/x?y"},
-        {fnAt("http://router.lan/x"), "http://192.168.1.1:80/x"},
-        {fnAt("http://192.168.1.1.evil/x"), "http://192.168.1.1:80/x"},
-        {fnAt("http://127.0.0.1:99/x"), "http://192.168.1.1:99/x"},
-        {fnAt("http://[::ffff:192.168.1.1]/x"), "http://192.168.1.1:80/x"},
-        {fnAt("http://192.168.1.1:0/x"), ""},
-        {fnAt("http://192.168.1.1:-1/x"), ""},
-        {fnAt("http://192.168.1.1:65536/x"), ""},
-        {fnAt("http://192.168.1.1:99999999999999999999/x"), ""},
-        {fnAt("http://192.168.1.1@evil/x"), ""},
-        {fnAt("http://a:b@192.168.1.1/x"), ""},
-        {fnAt("https://192.168.1.1/x"), ""},
-        {fnAt("file:///etc/passwd"), ""},
-        {"HTTP/1.1 404 No\r\nLOCATION: http://192.168.1.1/x\r\n\r\n", ""},
-        {"HTTP/1.1 200 OK\r\n\r\n", ""},
-        {"", ""}};
-    for (const Case& one : rgCases) {
+        {fnAt("http://192.168.1.2:5000/x?y"), "http://192.168.1.1:5000/x?y", false},
+        {fnAt("http://router.lan/x"), "http://192.168.1.1:80/x", false},
+        {fnAt("http://192.168.1.1.evil/x"), "http://192.168.1.1:80/x", false},
+        {fnAt("http://127.0.0.1:99/x"), "http://192.168.1.1:99/x", false},
+        {fnAt("http://[::ffff:192.168.1.1]/x"), "http://192.168.1.1:80/x", false},
+        {fnAt("http://192.168.1.1:0/x"), "", false},
+        {fnAt("http://192.168.1.1:-1/x"), "", false},
+        {fnAt("http://192.168.1.1:65536/x"), "", false},
+        {fnAt("http://192.168.1.1:99999999999999999999/x"), "", false},
+        {fnAt("http://192.168.1.1@evil/x"), "", false},
+        {fnAt("http://a:b@192.168.1.1/x"), "", false},
+        {fnAt("https://192.168.1.1/x"), "", false},
+        {fnAt("file:///etc/passwd"), "", false},
+        {"HTTP/1.1 404 No\r\nLOCATION: http://192.168.1.1/x\r\n\r\n", "", false},
+        {"HTTP/1.1 200 OK\r\n\r\n", "", false},
+        {"", "", false}};
+    for (const auto& [szAnswer, szPlace, blAnybodys] : rgCases) {
         for (const bool blGateway : {true, false}) {
             std::string szReason;
-            const auto place = tavo::LocationOf(one.szAnswer, "192.168.1.1", blGateway, szReason);
-            EXPECT_EQ(place ? place->Text() : "", blGateway || one.blAnybodys ? one.szPlace : "") << one.szAnswer;
+            const auto place = tavo::LocationOf(szAnswer, "192.168.1.1", blGateway, szReason);
+            EXPECT_EQ(place ? place->Text() : "", blGateway || blAnybodys ? szPlace : "") << szAnswer;
             EXPECT_EQ(szReason.empty(), place.has_value());
         }
     }

@@ -180,43 +180,37 @@ TEST_F(RelayRouter, WhenTheRouterIsNotAskedAndWhenThatFails) {
 TEST_F(RelayRouter, InitState) {
     const std::string szNoUserDb =
         "file not exist=/etc/portforward/router_upnp.db.user, this is case of compatibility fail";
-    const struct {
-        std::string szConf;  // empty: nothing stored
-        std::string szCache;
-        bool blUserDb;
-        int nResult;
-        int nState;
-        std::string szLines = {};
-    } rgCases[] = {
-        {kUpnpConf, "", false, 0, 2},
-        {Conf("AirPort", "x", "no", "yes"), "", false, 0, 2},
-        {Conf("A", "B", "no", "no"), "[192.168.1.1]\nrouter_detect=upnp_natpmp\n", false, 0, 3},
+    // Where the settings are empty, nothing is stored.
+    const std::tuple<std::string, std::string, bool, int, int, std::string> rgCases[] = {
+        {kUpnpConf, "", false, 0, 2, {}},
+        {Conf("AirPort", "x", "no", "yes"), "", false, 0, 2, {}},
+        {Conf("A", "B", "no", "no"), "[192.168.1.1]\nrouter_detect=upnp_natpmp\n", false, 0, 3, {}},
         {Conf("A", "B", "unknown", "no"), "", false, 0, 1, szNoUserDb},
-        {Conf("Acme", "R2", "unknown", "no"), "", true, 0, 3},
-        {Conf("AirPort", "any", "unknown", "no"), "", true, 0, 2},
+        {Conf("Acme", "R2", "unknown", "no"), "", true, 0, 3, {}},
+        {Conf("AirPort", "any", "unknown", "no"), "", true, 0, 2, {}},
         {Conf("A", "B", "no", "No"), "", false, -1, 0, "non-support szSupport=No\nTLibSupportStringToEnum(No) failed"},
-        {"", "", false, 0, 1},
-        {"", "[10.0.0.1]\nrouter_detect=manual\n", false, 0, 1},
-        {"", "[192.168.1.1]\nrouter_detect=manual\n", false, 0, 3},
+        {"", "", false, 0, 1, {}},
+        {"", "[10.0.0.1]\nrouter_detect=manual\n", false, 0, 1, {}},
+        {"", "[192.168.1.1]\nrouter_detect=manual\n", false, 0, 3, {}},
         {"", "[192.168.1.1]\nrouter_detect=Manual\n", false, 0, 1, "invalid szValue=Manual"},
     };
-    for (const auto& c : rgCases) {
+    for (const auto& [szConf, szCache, blUserDb, nResult, nState, szLines] : rgCases) {
         SetUp();
         std::filesystem::remove("/etc/portforward/router.conf");
-        if (!c.szConf.empty()) {
-            Write("/etc/portforward/router.conf", c.szConf);
+        if (!szConf.empty()) {
+            Write("/etc/portforward/router.conf", szConf);
         }
-        if (!c.szCache.empty()) {
-            Write(SZF_DETECT_MANUAL_CACHE, c.szCache);
+        if (!szCache.empty()) {
+            Write(SZF_DETECT_MANUAL_CACHE, szCache);
         }
-        if (c.blUserDb) {
+        if (blUserDb) {
             Write("/etc/portforward/router_upnp.db.user", "");
         }
         auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;
-        EXPECT_EQ(GetInitState(&enState), c.nResult) << c.szConf << c.szCache;
-        EXPECT_EQ(enState, c.nState) << c.szConf << c.szCache;
+        EXPECT_EQ(GetInitState(&enState), nResult) << szConf << szCache;
+        EXPECT_EQ(enState, nState) << szConf << szCache;
         std::erase(gLog, "file=/etc/portforward/router.conf not exists");
-        EXPECT_EQ(LastLines(c.szLines + "\n"), c.szLines);
+        EXPECT_EQ(LastLines(szLines + "\n"), szLines);
     }
     SetUp();
     auto enState = TAVO_ROUTER_INIT_STATE_UNKNOWN;

@@ -132,61 +132,55 @@ TEST_F(Saving, EndsAtTheStepThatFails) {
     const std::string szNoLimit = "get max rule fail\ncheck exceed max rule fail";
     const std::string szNoWrite = "> 60\n" + kWrite + "\nsave config failed\n";
     const std::string szNoKey = "\nFailed to Set run key [/etc/tavoinfo.conf]";
-    const struct {
-        const char* szWay;
-        const char* szFail;
-        int nWorks;
-        std::string szEnd;
-        bool blWritten;
-        int nSlept = 0;
-    } rgFailures[] = {
-        {"upnp", "hash", 1, "> 40\nhash malloc failed\nadd rule failed", false},
-        {"upnp", "service", 0, "> 40\nset service name=Web\nadd rule failed", false},
-        {"", "", 0, "> 40\ncan not get support upnp", false},
-        {"upnp", "run key", 0, "> 40\n> runnatpmpportmapping=no" + szNoKey, false},
-        {"upnp", "run key", 1, "> 40\n> runnatpmpportmapping=no\n> runupnpportmapping=no" + szNoKey, false},
-        {"natpmp", "look-up", 0, szNoLimit, false},
-        {"upnp", "look-up", 0, szNoLimit, false},
-        {"natpmp", "count", 0, "TLIBPFCountRuleConf fail\nget setting rules fail\ncheck exceed max rule fail", false},
-        {"natpmp", "write", 0, szNoWrite + "sync rule to file fail", false},
-        {"upnp", "write", 0, szNoWrite + "can not sync rules to file", false},
-        {"natpmp", "run key", 2, "> 80\n" + kNatpmpOn + "\nFailed to Set natpmp run key!", true},
-        {"upnp", "run key", 2, "> 80\n" + kUpnpOn + "\nFailed to Set upnp run key!", true},
+    const std::tuple<const char*, const char*, int, std::string, bool, int> rgFailures[] = {
+        {"upnp", "hash", 1, "> 40\nhash malloc failed\nadd rule failed", false, 0},
+        {"upnp", "service", 0, "> 40\nset service name=Web\nadd rule failed", false, 0},
+        {"", "", 0, "> 40\ncan not get support upnp", false, 0},
+        {"upnp", "run key", 0, "> 40\n> runnatpmpportmapping=no" + szNoKey, false, 0},
+        {"upnp", "run key", 1, "> 40\n> runnatpmpportmapping=no\n> runupnpportmapping=no" + szNoKey, false, 0},
+        {"natpmp", "look-up", 0, szNoLimit, false, 0},
+        {"upnp", "look-up", 0, szNoLimit, false, 0},
+        {"natpmp", "count", 0, "TLIBPFCountRuleConf fail\nget setting rules fail\ncheck exceed max rule fail", false,
+         0},
+        {"natpmp", "write", 0, szNoWrite + "sync rule to file fail", false, 0},
+        {"upnp", "write", 0, szNoWrite + "can not sync rules to file", false, 0},
+        {"natpmp", "run key", 2, "> 80\n" + kNatpmpOn + "\nFailed to Set natpmp run key!", true, 0},
+        {"upnp", "run key", 2, "> 80\n" + kUpnpOn + "\nFailed to Set upnp run key!", true, 0},
         {"natpmp", "exec", 0,
          "> exec /usr/tavo/sbin/natpmpd\nexec natpmpd daemon failed\nStartDaemon() natpmpd failed\n"
          "upnp daemon start failed",
-         true},
+         true, 0},
         {"upnp", "exec", 0,
          "> exec /usr/tavo/sbin/upnpd\nexec upnpd daemon failed\nStartDaemon() upnpd failed\n"
          "upnp daemon start failed",
-         true},
+         true, 0},
         {"natpmp", "remap", 0, "> remap\n> remap\ncheck natpmp daemon failed", true, 22},
         {"upnp", "status", 0,
          "> 90\nfailed to read key-value pairs from /var/tmp/upnp_portmap.status\ncheck daemon failed", true, 23},
         {"upnp", "hash", 2, "> 90\nfailed to allocate list\ncheck daemon failed", true, 1},
         {"manual", "description", 0, "> 60\nget desc and script failed\ncan not get router desc\ncan not get max ports",
-         false},
-        {"manual", "PF add port", 0, "> 60\nfailed to count port job of rules", false},
-        {"manual", "PF add range", 0, "> 60\nfailed to count range job of rules", false},
-        {"manual", "write", 0, szNoWrite + "can not sync rules to file", false},
+         false, 0},
+        {"manual", "PF add port", 0, "> 60\nfailed to count port job of rules", false, 0},
+        {"manual", "PF add range", 0, "> 60\nfailed to count range job of rules", false, 0},
+        {"manual", "write", 0, szNoWrite + "can not sync rules to file", false, 0},
         {"manual", "run", 0, "> 80\n" + kToolRun + "\nexecute tavoportforward failed\ntavoportforward start failed",
-         true},
+         true, 0},
     };
-    for (const auto& failure : rgFailures) {
+    for (const auto& [szWay, szFail, nWorks, szEnd, blWritten, nSlept] : rgFailures) {
         SetUp();
-        Router(failure.szWay);
-        if (std::string(failure.szFail) == "description") {
+        Router(szWay);
+        if (std::string(szFail) == "description") {
             std::filesystem::remove_all("/etc.defaults/portforward/routerdb");
         }
         Write("/var/tmp/upnp_portmap.status", "80/tcp=1\n");
-        gStage.szFail = failure.szFail;
-        gStage.nWorks = failure.nWorks;
-        EXPECT_EQ(Save(), -1) << failure.szWay << " " << failure.szFail;
-        EXPECT_EQ(LastLines(failure.szEnd), failure.szEnd) << failure.szWay << " " << failure.szFail;
+        gStage.szFail = szFail;
+        gStage.nWorks = nWorks;
+        EXPECT_EQ(Save(), -1) << szWay << " " << szFail;
+        EXPECT_EQ(LastLines(szEnd), szEnd) << szWay << " " << szFail;
         EXPECT_EQ(mResult.nStatus, 0);
-        EXPECT_EQ(gNSlept, failure.nSlept) << failure.szWay << " " << failure.szFail;
-        EXPECT_EQ(std::count(gLog.begin(), gLog.end(), "> remap"), std::string(failure.szFail) == "remap" ? 22 : 0);
-        EXPECT_EQ(Read(kRuleConf) != kOldRules, failure.blWritten) << failure.szWay << " " << failure.szFail;
+        EXPECT_EQ(gNSlept, nSlept) << szWay << " " << szFail;
+        EXPECT_EQ(std::count(gLog.begin(), gLog.end(), "> remap"), std::string(szFail) == "remap" ? 22 : 0);
+        EXPECT_EQ(Read(kRuleConf) != kOldRules, blWritten) << szWay << " " << szFail;
         EXPECT_TRUE(IsLockFree("/tmp/routerconf.lock"));
     }
 }
