@@ -429,11 +429,11 @@ TEST(Igd, APortThatIsListedTwiceIsNotTheEnd) {
 
 TEST(Igd, ATableEndsWhereTheRouterSaysSoOrAfterEightSeconds) {
     const JumpingClock clock;
-    const std::tuple<int, int, int, int, size_t> rgCases[] = {{0, 713, 0, 0, 0},   {2, 713, 0, 0, 2},
-                                                              {0, 714, 0, 0, 0},   {2, 714, 0, 0, 2},
-                                                              {2, 402, 0, 0, 2},   {0, 402, 0, 402, 0},
+    const std::tuple<int, int, int, int, size_t> rgCases[] = {{0, 713, 0, 0, 0}, {2, 713, 0, 0, 2},
+                                                              {0, 714, 0, 0, 0}, {2, 714, 0, 0, 2},
+                                                              {2, 402, 0, 0, 2}, {0, 402, 0, 402, 0},
                                                               {2, 501, 0, 0, 2}, {0, 401, 0, 401, 0},
-                                                              {7, 713, 1, 0, 7},   {99, 713, 1, tavo::kWireTooLong, 8}};
+                                                              {7, 713, 1, 0, 7}, {99, 713, 1, tavo::kWireTooLong, 8}};
     for (const auto& [nEntries, nEnd, nSeconds, nCode, nShown] : rgCases) {
         const auto pHttp = std::make_shared<Table>();
         for (int i = 1; i <= nEntries; ++i) {
@@ -654,7 +654,7 @@ TEST_F(SearchTest, TriesWhatTheGatewayItselfSaysOnceAndNotForEver) {
     EXPECT_FALSE(Search(290, [&] {
         if (Hear() && !std::exchange(blSaid, true)) {
             for (const char* szPlace : {"/a", "/b", "/c"}) {
-                Say(fdNeighbour, Answer(szPlace));
+                Send(fdNeighbour.Get(), Answer(szPlace), mFrom);
             }
         }
     }));
@@ -718,7 +718,7 @@ TEST_F(SearchTest, WhatComesFromOddPlacesAndLateIsHeard) {
     for (int i = 0; i < 70; ++i) {
         Say("HTTP/1.1 404 no\r\n\r\n");
     }
-    Say(SocketAt(kBox, 0), Answer("/forged"));
+    Send(SocketAt(kBox, 0).Get(), Answer("/forged"), mFrom);
     Say(Answer("/late"));
     EXPECT_FALSE(tavo::TakeLate(fdLate, kGateway)) << "of a flood, so many at once";
     EXPECT_EQ(tavo::TakeLate(fdLate, kGateway)->szPath, "/late");

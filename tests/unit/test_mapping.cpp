@@ -1053,20 +1053,6 @@ TEST(Mapping, ALeaseIsAskedForUntilTheRouterTakesNone) {
     }
 }
 
-// Some do not say what they refuse. One question more tells, once a router.
-TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
-    for (const bool blAll : {false, true}) {
-        MemoryRouter router;
-        int nAdds = 0;
-        router.mFnAdd = [&, blAll](const RouterMapping& mapping) {
-            ++nAdds;
-            return blAll || mapping.nLease != 0 ? std::optional(IgdReply(501)) : std::nullopt;
-        };
-        EXPECT_EQ(Told(Core().Run(router, Wanted(2))), blAll ? "1/tcp 501, 2/tcp 501" : "1/tcp 1 anew, 2/tcp 1 anew");
-        EXPECT_EQ(nAdds, 3);
-    }
-}
-
 TEST(Mapping, WhetherARouterTakesLeasesIsAskedOfEachRouter) {
     for (const auto& [szOther, blLease] : {std::pair("bb", true), {"aa", false}, {"", false}}) {
         Core core;
@@ -1295,38 +1281,29 @@ TEST(Record, OfEveryPortIsReadBack) {
 // Some do not say what they refuse: what is taken without a lease, twice, tells; one port that is refused in any case
 // does not, nor a refusal by itself.
 TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
-    class Mute : public MemoryRouter {
-    public:
-        RouterReply Add(RouterMapping& mapping) override {
+    // The ports that are refused whatever is asked; of the first askings those that are refused with a lease; what
+    // becomes of four ports; the askings; what is learnt.
+    const std::tuple<int, int, std::string, int, bool> rgCases[] = {{0, 99, "1 1 1 1 ", 2 + 2 + 1 + 1, true},
+                                                                    {0, 1, "1 1 1 1 ", 2 + 1 + 1 + 1, false},
+                                                                    {1, 99, "501 1 1 1 ", 2 + 2 + 2 + 1, true},
+                                                                    {1, 0, "501 1 1 1 ", 2 + 1 + 1 + 1, false},
+                                                                    {4, 99, "501 501 501 501 ", 2 + 2 + 2 + 1, false}};
+    for (const auto& [nRefused, nNoLease, szWords, nAsked, blPermanentOnly] : rgCases) {
+        MemoryRouter router;
+        int nAdds = 0;
+        router.mFnAdd = [&, nRefused = nRefused, nNoLease = nNoLease](const RouterMapping& mapping) {
             ++nAdds;
             const bool blRefused = mapping.nRouterPort <= nRefused || (mapping.nLease != 0 && nAdds <= nNoLease);
-            return blRefused ? IgdReply(501) : MemoryRouter::Add(mapping);
-        }
-        int nRefused = 0;  // ports, whatever is asked
-        int nNoLease = 0;  // askings with a lease, of the first ones
-        int nAdds = 0;
-    };
-    struct Case {
-        int nRefused;
-        int nNoLease;
-        Rows rgszEnd;
-        int nAdds;
-        bool blPermanent;
-    };
-    const Rows all = {"1/tcp 1 anew", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"};
-    const Case rgCases[] = {{0, 99, all, 2 + 2 + 1 + 1, true},
-                            {0, 1, all, 2 + 1 + 1 + 1, false},
-                            {1, 99, {"1/tcp 501", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"}, 2 + 2 + 2 + 1, true},
-                            {1, 0, {"1/tcp 501", "2/tcp 1 anew", "3/tcp 1 anew", "4/tcp 1 anew"}, 2 + 1 + 1 + 1, false},
-                            {4, 99, {"1/tcp 501", "2/tcp 501", "3/tcp 501", "4/tcp 501"}, 2 + 2 + 2 + 1, false}};
-    for (const Case& one : rgCases) {
-        Mute router;
-        router.nRefused = one.nRefused;
-        router.nNoLease = one.nNoLease;
+            return blRefused ? std::optional(IgdReply(501)) : std::nullopt;
+        };
         Core core;
-        EXPECT_EQ(Texts(core.Run(router, Wanted(4))), one.rgszEnd) << &one - rgCases;
-        EXPECT_EQ(router.nAdds, one.nAdds) << &one - rgCases;
-        EXPECT_EQ(core.habit.blPermanentOnly, one.blPermanent) << &one - rgCases;
+        std::string szSaid;
+        for (const tavo::Outcome& outcome : core.Run(router, Wanted(4)).rgOutcomes) {
+            szSaid += outcome.verdict.szWord + " ";
+        }
+        EXPECT_EQ(szSaid, szWords);
+        EXPECT_EQ(nAdds, nAsked) << szWords << nNoLease;
+        EXPECT_EQ(core.habit.blPermanentOnly, blPermanentOnly) << szWords << nNoLease;
     }
 }
 
