@@ -140,7 +140,7 @@ public:
 private:
     tavo::RouterReply Take(const std::vector<tavo::RouterMapping>& rgMappings, tavo::RouterReply reply) {
         for (const tavo::RouterMapping& mapping : rgMappings) {
-            if (reply.IsOk()) {
+            if (reply.IsOk() || reply.enReply == tavo::Reply::kTooLong) {
                 Require(mapping.szProtocol == "TCP" || mapping.szProtocol == "UDP", "entries make sense");
                 RequirePrintable(mapping.szDescription);
                 RequirePrintable(mapping.szClient);
