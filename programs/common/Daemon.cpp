@@ -22,17 +22,22 @@
 #include <string_view>
 #include <utility>
 
+#include "ground/BootClock.h"
 #include "ground/BootTimer.h"
 #include "ground/Descriptor.h"
 #include "ground/OwnFile.h"
 #include "ground/Paths.h"
 #include "ground/SysLog.h"
 #include "ground/TextFile.h"
+#include "ground/net/Neighbour.h"
 #include "ground/net/NetworkWatch.h"
 #include "programs/common/Instance.h"
+#include "programs/common/MadeFile.h"
+#include "programs/common/Published.h"
 #include "programs/common/SignalQueue.h"
 #include "programs/common/Watch.h"
 #include "tavo/core.h"
+#include "tavo/net.h"
 
 namespace tavo {
 
@@ -56,6 +61,8 @@ constexpr char kHelp[] =
     "The results stand in %s, the pid in %s.\n"
     "It maps only while %s=\"yes\" stands in /etc/tavoinfo.conf.\n";
 constexpr int kExitUsage = 2;
+constexpr int kExitLeft = 3;  // of a daemon that was stopped; the units know it
+constexpr size_t kAddressSize = 16;
 constexpr char kMarkerDir[] = "/tmp";
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr mode_t kPidFileMode = 0644;
@@ -64,6 +71,7 @@ constexpr const char* kLockFiles[] = {kRouterLock, "/tmp/upnp_detector.lock", "/
                                       "/tmp/upnp_test.lock"};
 constexpr int kCutPasses = 3;                              // in a row, before one goes on to its end
 constexpr auto kWithdrawLimit = std::chrono::seconds(60);  // of a router that answers slowly
+constexpr auto kSilentStop = std::chrono::seconds(10);     // one that took so long need not be tried again
 constexpr auto kEndLimit = std::chrono::seconds(70);       // for another instance: a pass, and the mappings
 constexpr auto kSettle = std::chrono::seconds(1);          // an address rarely changes alone
 // Between passes: that anybody on the network can cause, and that this box's own addresses, routes and links do.
@@ -106,13 +114,28 @@ Descriptor Detach() {
     return Descriptor(rgFd[1]);
 }
 
-bool Withdraw(Mapper& mapper) {
-    const auto end = Clock::now() + kWithdrawLimit;
-    const bool blGone = mapper.Withdraw([end] { return Clock::now() > end; });
-    if (!blGone) {
-        SysLog(LOG_ERR, "the router could not be asked to take the mappings away; it may keep them");
+// Whether the router in front may have something of ours, by the record; where none is in front, any router.
+bool HasLeft(const DaemonNames& names) {
+    MadeFile made(MadeFileOf(names).c_str());
+    Record& record = made.Get();
+    record.Prune(BootSeconds());
+    char szGateway[kAddressSize] = {};
+    if (record.Text().empty() || TAVONetDefaultGatewayGet(szGateway, sizeof(szGateway)) != 0) {
+        return !record.Text().empty();
     }
-    return blGone;
+    record.TurnTo({szGateway, HardwareAddress(szGateway)});
+    return !record.Here().empty();
+}
+
+int SayLeft(int nExit) {
+    SysLog(LOG_ERR, "the router could not be asked to take the mappings away; it may keep them");
+    return nExit;
+}
+
+// Whether all is gone. A router that cannot be found is no matter where nothing was made.
+bool Withdraw(const DaemonNames& names, Mapper& mapper, const std::function<bool()>& fnStop) {
+    const auto end = Clock::now() + kWithdrawLimit;
+    return mapper.Withdraw([&] { return fnStop() || Clock::now() > end; }) || !HasLeft(names);
 }
 
 // Tells the service manager, where one started us, that the work has begun. Our own children have nothing to tell it.
@@ -172,12 +195,12 @@ public:
         mFdEvents.Reset(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
         inotify_add_watch(mFdEvents.Get(), kMarkerDir, IN_CREATE | IN_MOVED_TO);
     }
-    void Loop();
+    int Loop();  // the exit status
 
 private:
     void Wait();
     void RunPass();
-    void Stop();
+    int Stop();
     void RemoveMarker() const {
         if (TLIBCFileExist(kMarker) == 1 && mMapper.IsSwitchedOn()) {
             unlink(kMarker);
@@ -235,15 +258,14 @@ void Frame::RunPass() {
     mBlRequested = false;
 }
 
-void Frame::Stop() {
-    if (!mSignals.IsHandOver()) {
-        Withdraw(mMapper);
-    }
+int Frame::Stop() {
+    const bool blDone = mSignals.IsHandOver() || Withdraw(mNames, mMapper, [] { return false; });
     unlink(mNames.szPidFile);
     RemoveMarker();
+    return blDone ? 0 : SayLeft(kExitLeft);
 }
 
-void Frame::Loop() {
+int Frame::Loop() {
     while (!mSignals.IsStop()) {
         mBlRequested = mSignals.TakeRequest() || mBlRequested;
         if (mBlRequested || Clock::now() >= mNext) {
@@ -256,7 +278,7 @@ void Frame::Loop() {
         WritePidFile(mNames);  // whoever asks for a start deletes it, and makes the marker afterwards
         Wait();
     }
-    Stop();
+    return Stop();
 }
 
 // The locks of saves, detections and tests, before anybody else can put something of his own in their places: a link,
@@ -292,8 +314,7 @@ int RunInstance(const DaemonNames& names, const MakeMapper& fnMake, Descriptor& 
     SysLog(LOG_INFO, "%s begins%s", names.szName, blTold ? "" : " anew");
     fdReady.Reset();
     NotifyReady();
-    frame.Loop();
-    return 0;
+    return frame.Loop();
 }
 
 int RunInBackground(const DaemonNames& names, const MakeMapper& fnMake, char* szTitle) {
@@ -310,16 +331,25 @@ int RunInBackground(const DaemonNames& names, const MakeMapper& fnMake, char* sz
     return Watch(names.szName, szTitle).Run([&] { return RunInstance(names, fnMake, fdReady); });
 }
 
+// Whoever ends has no way to tell us what became of its mappings, and may have been killed: the record has it. What
+// nobody has tried to take away, or a router has refused at once, is tried here; one that is silent was waited for.
 int StopRunning(const DaemonNames& names, const MakeMapper& fnMake) {
-    Instance instance(names.szLockFile);
-    bool blGone = true;
-    if (instance.Take()) {  // nobody ran; one that was killed may have left its mappings
-        const std::unique_ptr<Mapper> pMapper = fnMake();
-        blGone = !pMapper->IsSwitchedOn() || Withdraw(*pMapper);
-        unlink(names.szPidFile);
-        instance.Forget();
+    const auto start = Clock::now();
+    if (!EndRunning(names, SIGTERM)) {
+        return 1;
     }
-    return EndRunning(names, SIGTERM) && blGone ? 0 : 1;
+    unlink(names.szPidFile);  // of one that was killed, as what follows
+    Unpublish(names.szName);
+    if (!HasLeft(names)) {
+        return 0;
+    }
+    SignalQueue signals;  // another stop tells us to end, and goes on with what we leave
+    Instance instance(names.szLockFile);
+    if (Clock::now() - start >= kSilentStop || !instance.Take()) {
+        return SayLeft(1);
+    }
+    const std::unique_ptr<Mapper> pMapper = fnMake();
+    return Withdraw(names, *pMapper, [&] { return signals.IsStop(); }) ? 0 : SayLeft(1);
 }
 
 int RunDaemon(const DaemonNames& names, const MakeMapper& fnMake, std::string_view szOptions, char* szTitle) {

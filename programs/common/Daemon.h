@@ -8,6 +8,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace tavo {
@@ -20,6 +21,12 @@ struct DaemonNames {
     const char* szLockFile;
     const char* szResultFile;  // what became of the newest request
 };
+
+// The record of what it has made at routers.
+inline std::string MadeFileOf(const DaemonNames& names) {
+    const std::string_view szName = names.szName;  // less its "d"
+    return "/var/lib/tavo/" + std::string(szName.substr(0, szName.size() - 1)) + "_made.conf";
+}
 
 class Mapper {
 public:
@@ -45,7 +52,7 @@ using MakeMapper = std::function<std::unique_ptr<Mapper>()>;
 
 // A daemon's whole main(): arguments, the way into the background, then a mapper until SIGTERM, SIGINT or
 // SIGUSR1. Exit status: 0; 1 when another instance runs, or what was asked for could not be done; 2 for a wrong
-// argument.
+// argument; 3 when it was stopped, and the router may have kept mappings, which is no reason to start it again.
 int DaemonMain(int argc, char** argv, const DaemonNames& names, const MakeMapper& fnMake);
 
 }  // namespace tavo

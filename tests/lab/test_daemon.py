@@ -5,6 +5,7 @@ import os
 import re
 import signal
 import subprocess
+import time
 
 import homelab
 from homelab import BOX, HERE, wait_for
@@ -99,6 +100,26 @@ class Daemon(homelab.Case):
         LAB.start_router()
         self.assertEqual(run.returncode, 1)
         self.assertIn("it may keep them", run.stderr)
+
+    def test_a_stop_says_what_the_one_that_ran_has_left(self):
+        for fault, asleep, left in (("gives_nothing_back", None, 1), ("none", lambda: LAB.router.pid, 1),
+                                    ("none", LAB.daemon_pid, 0)):
+            with self.subTest(fault=fault, left=left):
+                self.tearDown()
+                LAB.start_scripted(fault)
+                LAB.save("1,1,tcp,5001,5001")
+                self.assertEqual(LAB.status()["5001/tcp"], "1")
+                if asleep is not None:
+                    os.kill(asleep(), signal.SIGSTOP)
+                stop = LAB.start("box", DAEMON, "--stop", stderr=subprocess.PIPE, text=True)
+                if not left:
+                    time.sleep(0.5)
+                    self.crash()  # in the middle of its stop
+                said = stop.communicate(timeout=15)[1]
+                self.assertEqual(("it may keep them" in said, stop.returncode), (left, left))
+                self.assertEqual((LAB.processes_of(DAEMON), LAB.watcher()), ([], 0))
+                os.kill(LAB.router.pid, signal.SIGCONT)
+                self.assertEqual(sum(row[1] == 5001 for row in LAB.scripted()["table"]), left)
 
     def test_a_stop_takes_the_mappings_away_whatever_is_left_to_stop(self):
         for before in (lambda: None, self.crash, lambda: os.kill(LAB.watcher(), signal.SIGKILL),

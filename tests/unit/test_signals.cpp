@@ -13,6 +13,8 @@
 #include "programs/common/Instance.h"
 #include "programs/common/SignalQueue.h"
 #include "programs/common/Watch.h"
+#include "programs/natpmpd/NatpmpMapper.h"
+#include "programs/upnpd/UpnpMapper.h"
 #include "tavo/core.h"
 #include "world.h"
 
@@ -49,6 +51,8 @@ TEST(SignalQueue, WhatAQuestionTookInEndsTheNextWaitAndNoFurtherOne) {
 
 constexpr tavo::DaemonNames kNames = {"played", "UPnP", "k", "/run/played.pid", "/run/played.lock", "/tmp/played.out"};
 constexpr char kMarker[] = "/tmp/pfProgress";
+constexpr char kMade[] = "[1]\ngateway=\"192.168.1.1\"\nprotocol=\"TCP\"\nrouter_port=\"80\"\nbox_port=\"80\"\n";
+constexpr char kElsewhere[] = "[1]\ngateway=\"10.0.0.1\"\nprotocol=\"TCP\"\nrouter_port=\"80\"\nbox_port=\"80\"\n";
 
 // Tells its story in a file: each pass as "request" or "clock", "cut" or "whole", and the marker that it leaves.
 class PlayedMapper : public tavo::Mapper {
@@ -63,10 +67,13 @@ public:
         }
         return mNSeconds;
     }
-    bool IsSwitchedOn() const override { return mBlOn; }
+    bool IsSwitchedOn() const override { return true; }
     bool Withdraw(const std::function<bool()>& fnStop) override {
         Tell("withdraw");
         while (mBlSlow && !fnStop()) {
+        }
+        if (!mBlSlow) {
+            std::filesystem::remove(tavo::MadeFileOf(kNames));
         }
         return !mBlSlow;
     }
@@ -78,7 +85,6 @@ public:
     bool OnNetworkChange() override { return true; }
     static void Tell(const std::string& szLine) { std::ofstream(kNames.szResultFile, std::ios::app) << szLine << "\n"; }
     int mNSeconds = 1;
-    bool mBlOn = true;
     bool mBlSlow = false;  // the router does not let its mappings go
     int mFdWord = -1;
 
@@ -113,15 +119,16 @@ int RunPlayed(const PlayedMapper& mapper, std::string szOption = "--foreground",
                             rgszArguments, kNames, [&] { return std::make_unique<PlayedMapper>(mapper); });
 }
 
-// Each look at the clock takes a second, so that the limits go by faster; tells what it took, and its last word.
+// Each look at the clock takes a second, so that the limits go by faster; tells what it took, a long time
+// without the looks besides, and its last word.
 int RunFast(const PlayedMapper& mapper, const std::string& szOption, const std::string& szSecond = "") {
     const auto start = tavo::BootClock::now();
     gLog = {""};
     gNClockStep = 1;
     const int nExit = RunPlayed(mapper, szOption, szSecond);
     gNClockStep = 0;
-    PlayedMapper::Tell(std::to_string((tavo::BootClock::now() - start) / std::chrono::seconds(1)) + " s " +
-                       gLog.back());
+    const auto nTook = (tavo::BootClock::now() - start) / std::chrono::seconds(1);
+    PlayedMapper::Tell(std::to_string(nTook < 60 ? nTook : nTook / 10 * 10) + " s " + gLog.back());
     return nExit;
 }
 
@@ -179,17 +186,41 @@ TEST(Daemon, PassesFollowTheirSignals) {
     }
 }
 
+// A process that has the lock until some time after SIGTERM, and leaves whatever is on record.
+pid_t HoldUntilTold(int nMilliseconds) {
+    const pid_t pid = fork();
+    if (pid == 0) {
+        const tavo::SignalQueue queue;
+        tavo::Instance instance(kNames.szLockFile);
+        pollfd told = queue.Waiting();
+        poll(&told, instance.Take() ? 1 : 0, 20000);
+        usleep(static_cast<useconds_t>(nMilliseconds) * 1000);
+        _exit(0);
+    }
+    for (int i = 0; i < 1000 && tavo::Instance(kNames.szLockFile).Holder() != pid; ++i) {
+        usleep(2000);
+    }
+    return pid;
+}
+
 TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
     struct Case {
         const char* szOption;
         int nExit;
         const char* szStory = "";
         bool blHeld = false;  // by somebody who does not end
-        bool blOn = true;
+        const char* szMade = "";
         bool blSlow = false;
         const char* szSecond = "";
+        bool blTerm = false;  // else what runs is told to hand over
+        int nEnds = 0;        // one is there that ends so many milliseconds after it was told to
     };
-    const char* szStays = "71 s played that runs does not end (lock /run/played.lock)\n";  // with the first look
+    constexpr int kSoon = 1;
+    constexpr int kLate = 500;  // as looks go by, it has waited for a silent router
+    const char* szStays = "70 s played that runs does not end (lock /run/played.lock)\n";
+    const char* szKept = "withdraw\n60 s router could not be asked to take the mappings away; it may keep them\n";
+    const char* szEndedAndKept =
+        "request cut\nwithdraw\n60 s router could not be asked to take the mappings away; it may keep them\n";
     const char* szTaken = "0 s played is running (lock /run/played.lock)\n";
     const Case rgCases[] = {
         {"--help", 0},
@@ -203,21 +234,37 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         {.szOption = "--foreground", .nExit = 1, .szStory = szStays, .blHeld = true, .szSecond = "--take-over"},
         {.szOption = "--foreground", .nExit = 0, .szStory = "request cut\n", .szSecond = "--take-over"},
         {"", 1, szTaken, true},
-        {"--stop", 0, "withdraw\n"},
-        {"--stop", 0, "", false, false},
-        {"--stop", 1, szStays, true},
-        {"--stop", 1, "withdraw\n62 s router could not be asked to take the mappings away; it may keep them\n", false,
-         true, true}};
+        {"--stop", 0, "withdraw\n", false, kMade},
+        {"--stop", 0},
+        {"--stop", 0, "", false, kElsewhere},
+        {"--stop", 1, szStays, true, kMade},
+        {"--stop", 1, szKept, false, kMade, true},
+        {.szOption = "--stop", .nExit = 0, .szStory = "withdraw\n", .szMade = kMade, .nEnds = kSoon},
+        {.szOption = "--stop", .nExit = 0, .szMade = kElsewhere, .nEnds = kSoon},
+        {.szOption = "--stop", .nExit = 1, .szMade = kMade, .nEnds = kLate},
+        {.szOption = "--foreground",
+         .nExit = 3,
+         .szStory = szEndedAndKept,
+         .szMade = kMade,
+         .blSlow = true,
+         .blTerm = true},
+        {.szOption = "--foreground",
+         .nExit = 0,
+         .szStory = "request cut\nwithdraw\n60 s begins\n",
+         .blSlow = true,
+         .blTerm = true}};
     std::filesystem::create_directories("/tmp/t");
     for (const Case& one : rgCases) {
         std::filesystem::remove(kNames.szResultFile);
+        const pid_t pidEnds = one.nEnds == 0 ? 0 : HoldUntilTold(one.nEnds);
         tavo::Instance holder(kNames.szLockFile);
         ASSERT_TRUE(!one.blHeld || holder.Take());
+        Write(tavo::MadeFileOf(kNames), one.szMade);
         Write(one.blHeld ? kNames.szLockFile : "/tmp/t/none", "x");  // it does not say who it is
         EXPECT_EQ(InChild([&] {
-                      PlayedMapper mapper([](int) { raise(SIGUSR1); });
-                      mapper.mBlOn = one.blOn;
+                      PlayedMapper mapper([&](int) { raise(one.blTerm ? SIGTERM : SIGUSR1); });
                       mapper.mBlSlow = one.blSlow;
+                      gNClockStep = one.nEnds == kLate ? 1 : 0;
                       dup2(open("/tmp/t/said", O_WRONLY | O_CREAT | O_TRUNC, 0600), STDOUT_FILENO);
                       dup2(open("/dev/null", O_WRONLY), STDERR_FILENO);
                       const int nExit = one.blHeld || one.blSlow ? RunFast(mapper, one.szOption, one.szSecond)
@@ -226,10 +273,13 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
                       return nExit;
                   }),
                   one.nExit)
-            << one.szOption << one.szSecond << one.blHeld;
+            << one.szOption << one.szSecond << one.szMade << one.nEnds;
+        EXPECT_TRUE(pidEnds == 0 || waitpid(pidEnds, nullptr, 0) == pidEnds);
         EXPECT_EQ(Read(kNames.szResultFile), one.szStory) << one.szOption;
         EXPECT_EQ(Read("/tmp/t/said").starts_with("Usage: played ["), &one == rgCases);
     }
+    EXPECT_EQ(tavo::MadeFileOf(tavo::kUpnpNames), tavo::kUpnpMadeFile);
+    EXPECT_EQ(tavo::MadeFileOf(tavo::kNatpmpNames), "/var/lib/tavo/natpmp_made.conf");
     signal(SIGHUP, SIG_IGN);
     tavo::Instance parent(tavo::Watch::LockFile(kNames.szName));
     ASSERT_TRUE(parent.Take());
