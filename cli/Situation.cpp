@@ -117,8 +117,8 @@ const Published* Situation::Word() const {
 std::vector<PublishedLeftOver> Situation::LeftOver() const {
     const Published* pWord = Word();
     auto rgLeftOver = pWord != nullptr ? pWord->rgLeftOver : std::vector<PublishedLeftOver>();
-    for (const Daemon* pDaemon : {&upnpd, &natpmpd}) {
-        if (pDaemon != Keeper() && pDaemon->blAlive && pDaemon->published) {
+    for (const Daemon* pDaemon : {&upnpd, &natpmpd}) {  // of one that has ended, what it could not take away
+        if (pDaemon->published && &*pDaemon->published != pWord) {
             const auto& rgMore = pDaemon->published->rgLeftOver;
             rgLeftOver.insert(rgLeftOver.end(), rgMore.begin(), rgMore.end());
         }

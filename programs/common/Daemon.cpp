@@ -338,9 +338,9 @@ int StopRunning(const DaemonNames& names, const MakeMapper& fnMake) {
     if (!EndRunning(names, SIGTERM)) {
         return 1;
     }
-    unlink(names.szPidFile);  // of one that was killed, as what follows
-    Unpublish(names.szName);
+    unlink(names.szPidFile);  // of one that was killed
     if (!HasLeft(names)) {
+        Unpublish(names.szName);  // else its last word is what is left
         return 0;
     }
     SignalQueue signals;  // another stop tells us to end, and goes on with what we leave

@@ -307,15 +307,29 @@ bool RuleMapper::Withdraw(const std::function<bool()>& fnEnd) {
     }
     const std::vector<RouterMapping> rgOthers = mWanted.rgOthers.value_or(mWanted.rgMappings);
     Heard();  // what was waited for was not the router
+    PassResult result;
     for (int i = 0; i < kWithdrawTries && !fnStop() && FindGateway(); ++i) {
-        const PassResult result = blTurn ? Map({}, false, fnStop) : TakeAwayBesides(rgOthers, fnStop);
+        result = blTurn ? Map({}, false, fnStop) : TakeAwayBesides(rgOthers, fnStop);
         if (result.transport.IsOk() && result.rgOutcomes.empty()) {
             mTold.Get().blWithdrawn = true;
             mTold.Save();
             return true;
         }
     }
+    PublishLeft(std::move(result));
     return false;
+}
+
+// The last word of a daemon that has ended, for whoever asks what is left.
+void RuleMapper::PublishLeft(PassResult result) const {
+    Published state{mNames.szName, mNames.szProtocol};
+    state.szGateway = mSzGateway;
+    state.szBox = mSzBox;
+    state.enRouter = result.enRouter;
+    state.szRouterWhy = WhyOf(state.enRouter, mNames.szProtocol);
+    state.rgOutcomes = std::move(result.rgOutcomes);
+    state.nAt = state.nNextLook = std::time(nullptr);
+    Publish(state);
 }
 
 }  // namespace tavo

@@ -87,6 +87,7 @@ private:
     void LookAtRouter(Published& state, const std::function<bool()>& fnStop);
     void AskOutside(const std::function<bool()>& fnStop);
     void PublishPass(PassResult result, bool blRequested, int nSecondsToNext, const std::function<bool()>& fnStop);
+    void PublishLeft(PassResult result) const;
     void TellNews(const Published& state, bool blRequested);
 
     const DaemonNames& mNames;

@@ -301,12 +301,15 @@ TEST_F(RuleMapping, WhatIsWrittenOfAPassIsThisPass) {
     mapper.mResult.transport = {tavo::Reply::kTimeout};
     EXPECT_FALSE(mapper.Withdraw([] { return false; }));
     EXPECT_EQ(mapper.TakeCalls(), rgszTries);
-    EXPECT_FALSE(std::filesystem::exists(kPublished));
     mapper.mResult.transport = {tavo::Reply::kOk};
     mapper.mResult.rgOutcomes = {tavo::Outcome{"81/tcp", {tavo::PortState::kWaiting, "606"}}};
+    mapper.mResult.rgOutcomes[0].blLeftOver = true;
     EXPECT_FALSE(mapper.Withdraw([] { return false; })) << "something is left";
+    std::istringstream(Read(kPublished)) >> js;
+    EXPECT_EQ(js["left_over"][0]["name"], "81/tcp") << "its last word, where it is left";
     mapper.mResult.rgOutcomes.clear();
     EXPECT_TRUE(mapper.Withdraw([] { return false; }));
+    EXPECT_FALSE(std::filesystem::exists(kPublished));
 }
 
 }  // namespace
