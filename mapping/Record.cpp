@@ -90,7 +90,7 @@ std::set<std::string> Record::OtherLines() const {
     std::set<std::string> setLines;
     for (const Elsewhere& row : mRgElsewhere) {
         const RouterName here{row.router.szGateway, row.router.szHardware, mRouter.szLine};
-        if (row.router.szLine != mRouter.szLine && here.IsSame(mRouter)) {
+        if (!row.router.szLine.empty() && row.router.szLine != mRouter.szLine && here.IsSame(mRouter)) {
             setLines.insert(row.router.szLine);
         }
     }

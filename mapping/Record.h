@@ -31,10 +31,11 @@ struct RouterName {
     std::string szLine = {};  // which of its lines, each with a table of its own, where it has several
 
     bool operator==(const RouterName& other) const = default;
+    // One that says nothing of a line may be any of them.
     bool IsSame(const RouterName& other) const {
         const bool blOne = szHardware.empty() || other.szHardware.empty() ? szGateway == other.szGateway
                                                                           : szHardware == other.szHardware;
-        return blOne && szLine == other.szLine;
+        return blOne && (szLine.empty() || szLine == other.szLine);
     }
 };
 
@@ -107,6 +108,8 @@ public:
 
     // The other lines of this router that have rows.
     std::set<std::string> OtherLines() const;
+    // Whether anything is known of this router, at whichever line.
+    bool HasRows() const { return !mHere.empty() || !OtherLines().empty(); }
     // Drops the rows of other routers that have surely run out.
     void Prune(int64_t nNow, bool blLeases = false);
     // Nothing that this router once granted counts any more: all of it is due.

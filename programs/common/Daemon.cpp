@@ -124,7 +124,7 @@ bool HasLeft(const DaemonNames& names) {
         return !record.Text().empty();
     }
     record.TurnTo({szGateway, HardwareAddress(szGateway)});
-    return !record.Here().empty();
+    return record.HasRows();
 }
 
 int SayLeft(int nExit) {

@@ -94,6 +94,12 @@ void UpnpMapper::Remember() {
     KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mBlNoGet, mHabit.blNoRanges});
 }
 
+RouterName UpnpMapper::Name(const std::function<bool()>& fnStop) {
+    RouterName name = Front(fnStop);
+    name.szLine = mPlace.szLine;
+    return name;
+}
+
 // Another device at the address of the one before has habits of its own.
 void UpnpMapper::TurnTo(const RouterName& router) {
     mMade.Get().TurnTo(router);
@@ -133,14 +139,14 @@ bool UpnpMapper::OnWake() {
 }
 
 bool UpnpMapper::HasMade(const std::function<bool()>& fnStop) {
-    mMade.Get().TurnTo(Front(fnStop));
-    return !LeftOnRecord(mMade.Get(), {}, {}, {}, BootSeconds()).empty();
+    mMade.Get().TurnTo(Name(fnStop));
+    return !LeftOnRecord(mMade.Get(), {}, {}, {}, BootSeconds()).empty() || !mMade.Get().OtherLines().empty();
 }
 
 PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop) {
     ChooseLine(fnStop);
     if (!FindRouter(fnStop)) {
-        mMade.Get().TurnTo(Front([] { return true; }));  // nobody is there to be asked
+        mMade.Get().TurnTo(Name([] { return true; }));  // nobody is there to be asked
         PassResult result = Failed(rgWanted, kNoIgd, RouterState::kNoService);
         result.blStopped = fnStop();
         // A router that maps no ports any more may still forward those that we made.
@@ -152,8 +158,7 @@ PassResult UpnpMapper::MapOnce(const std::vector<RouterMapping>& rgWanted, const
         }
         return result;
     }
-    RouterName name = Front(fnStop);
-    name.szLine = mPlace.szLine;
+    const RouterName name = Name(fnStop);
     TurnTo(name);
     mMade.Get().Prune(BootSeconds());
     mPIgd->SetStop(fnStop);

@@ -34,6 +34,7 @@ private:
 
     bool FindRouter(const std::function<bool()>& fnStop);
     void Remember();
+    RouterName Name(const std::function<bool()>& fnStop);
     void TurnTo(const RouterName& router);
     void ChooseLine(const std::function<bool()>& fnStop);
     OutcomeList ClearOtherLines(const RouterName& router, const Surroundings& around);

@@ -1307,6 +1307,34 @@ TEST(Mapping, ARefusalOfALeaseIsLearntFromWhatIsTakenWithoutOne) {
     }
 }
 
+// Each line of a router has a table of its own. What was made before lines were told apart is of whichever is in use.
+TEST(Record, TheLinesOfARouterHaveRowsOfTheirOwn) {
+    const auto fnRow = [](const char* szLine, int nPort) {
+        const std::string szPort = std::to_string(nPort);
+        return std::string("[") + szLine + szPort + "]\ngateway=g\nhardware=aa\nline=" + szLine +
+               "\nprotocol=TCP\nrouter_port=" + szPort + "\nbox_port=1\nclient=c\ntext=t\nshown=yes\nlease=0\n";
+    };
+    tavo::Record record(fnRow("", 1) + fnRow("/a", 2) + fnRow("/b", 3), "");
+    const auto fnAt = [&](const char* szLine) {
+        record.TurnTo({"g", "aa", szLine});
+        std::string szSeen;
+        for (const auto& [key, made] : record.Here()) {
+            szSeen += std::to_string(key.second);
+        }
+        for (const std::string& szOther : record.OtherLines()) {
+            szSeen += " " + szOther;
+        }
+        return szSeen + (record.HasRows() ? "" : " none");
+    };
+    EXPECT_EQ(fnAt("/a"), "12 /b");
+    record = tavo::Record(record.Text(), "");
+    EXPECT_EQ(fnAt("/c"), " /a /b");
+    EXPECT_EQ(fnAt("/b"), "3 /a");
+    EXPECT_EQ(fnAt("/a"), "12 /b");
+    record.TurnTo({"g", "bb", "/a"});
+    EXPECT_FALSE(record.HasRows());
+}
+
 // The neighbour's hardware is not always known. A pass without it must not make one router's rows another one's.
 TEST(Record, ALookWithoutTheHardwareMixesNoRouters) {
     tavo::Record record("", "one");
