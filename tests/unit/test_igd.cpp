@@ -699,6 +699,24 @@ TEST_F(SearchTest, IsOverSoonWhereThereIsNobody) {
     }
 }
 
+// What is tried and of no use may take longer than the silence that ends a search.
+TEST_F(SearchTest, ATryIsNoSilence) {
+    const JumpingClock clock;
+    int nTried = 0;
+    const auto fnTry = [&](const tavo::HttpUrl&) {
+        gNClockJumped += 4;
+        return ++nTried == 3;
+    };
+    EXPECT_TRUE(tavo::SearchGateway(kGateway, kBox, 30000, 0, fnTry, [&] {
+        if (Hear()) {
+            Say(Answer("/a"));
+            Say(Answer("/b"));
+            Say(Answer("/c"));
+        }
+        return false;
+    }));
+}
+
 // Some answer to the protocol's own port only, and some when nobody waits any more.
 TEST_F(SearchTest, WhatComesFromOddPlacesAndLateIsHeard) {
     EXPECT_TRUE(Search(

@@ -202,8 +202,8 @@ bool SearchGateway(const std::string& szGateway, const std::string& szLocal, int
         const Heard heard = Receive(rgWaiting[0].revents != 0 ? fd.Get() : fdKnown.Get(), szGateway, nRefused);
         if (heard.blGateway) {
             blSpoke = true;
-            end = std::min(limit, std::max(end, Clock::now() + kSilence));
             blFound = heard.location && setSeen.insert(heard.location->Text()).second && fnTry(*heard.location);
+            end = std::min(limit, std::max(end, Clock::now() + kSilence));  // a try takes its time, too
         } else if (heard.location && rgOthers.size() < kMostOthers) {
             rgOthers.push_back(*heard.location);
         }
