@@ -116,7 +116,7 @@ Descriptor Detach() {
 
 // Whether the router in front may have something of ours, by the record; where none is in front, any router.
 bool HasLeft(const DaemonNames& names) {
-    MadeFile made(MadeFileOf(names).c_str());
+    MadeFile made(names.szMadeFile);
     Record& record = made.Get();
     record.Prune(BootSeconds());
     char szGateway[kAddressSize] = {};

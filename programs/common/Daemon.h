@@ -20,13 +20,8 @@ struct DaemonNames {
     const char* szPidFile;
     const char* szLockFile;
     const char* szResultFile;  // what became of the newest request
+    const char* szMadeFile;    // the record of what it has made at routers
 };
-
-// The record of what it has made at routers.
-inline std::string MadeFileOf(const DaemonNames& names) {
-    const std::string_view szName = names.szName;  // less its "d"
-    return "/var/lib/tavo/" + std::string(szName.substr(0, szName.size() - 1)) + "_made.conf";
-}
 
 class Mapper {
 public:

@@ -52,16 +52,27 @@ Abilities IgdRouter::What() const {
     return {true, false, false, std::to_string(kIgdConflict)};
 }
 
-RouterReply IgdRouter::List(std::vector<RouterMapping>& rgMappings) {
+RouterReply IgdRouter::ReadTable(std::vector<RouterMapping>& rgTable) {
     std::vector<IgdEntry> rgEntries;
     const int nCode = mIgd.List(rgEntries);
-    mListed = Take(nCode, std::move(rgEntries), rgMappings);
+    return Take(nCode, std::move(rgEntries), rgTable);
+}
+
+RouterReply IgdRouter::List(std::vector<RouterMapping>& rgMappings) {
+    RouterReply reply = ReadTable(rgMappings);
+    if (mBlNoGet) {
+        Keep(rgMappings, reply);
+    }
+    return reply;
+}
+
+void IgdRouter::Keep(const std::vector<RouterMapping>& rgTable, const RouterReply& reply) {
+    mListed = reply;
     mBlChanged = false;
     mMapTable.clear();
-    for (const RouterMapping& mapping : rgMappings) {
+    for (const RouterMapping& mapping : rgTable) {
         mMapTable.emplace(Place(mapping.szProtocol, mapping.nRouterPort), mapping);
     }
-    return mListed;
 }
 
 RouterReply IgdRouter::ListRange(const std::string& szProtocol, uint16_t nFirst, uint16_t nLast,
@@ -84,7 +95,8 @@ RouterReply IgdRouter::GetByName(const Place& place, RouterMapping& mapping) {
 RouterReply IgdRouter::GetByList(const Place& place, RouterMapping& mapping) {
     if (mListed.enReply != Reply::kTooLong && (mBlChanged || mListed.IsSilence())) {
         std::vector<RouterMapping> rgTable;
-        List(rgTable);
+        const RouterReply reply = ReadTable(rgTable);
+        Keep(rgTable, reply);
     }
     if (const auto it = mMapTable.find(place); mListed.IsOk() && it != mMapTable.end()) {
         mapping = it->second;

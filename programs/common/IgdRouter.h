@@ -35,6 +35,8 @@ public:
 private:
     using Place = std::pair<std::string, uint16_t>;
 
+    RouterReply ReadTable(std::vector<RouterMapping>& rgTable);
+    void Keep(const std::vector<RouterMapping>& rgTable, const RouterReply& reply);
     RouterReply GetByName(const Place& place, RouterMapping& mapping);
     RouterReply GetByList(const Place& place, RouterMapping& mapping);
 
@@ -42,7 +44,7 @@ private:
     std::string mSzBox;
     bool mBlNoGet;
     std::set<Place> mSetGranted;               // what it said yes to
-    std::map<Place, RouterMapping> mMapTable;  // as it was listed
+    std::map<Place, RouterMapping> mMapTable;  // as it was listed, where that has to do
     RouterReply mListed = {Reply::kTimeout};   // what the listing ended with
     bool mBlChanged = true;                    // something was asked for since
 };

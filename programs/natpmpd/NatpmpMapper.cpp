@@ -21,7 +21,6 @@ constexpr int kYoungAgain = 10;      // seconds until a gateway that has just st
 // Anybody on the network can say that the router has begun anew. Its clock is asked each time; that all is asked for
 // again whatever the clock says, and put on record, happens once in this time.
 constexpr auto kDoubtPause = std::chrono::minutes(10);
-constexpr char kMadeFile[] = "/var/lib/tavo/natpmp_made.conf";
 
 RouterState StateOf(Reply enReply) {
     switch (enReply) {
@@ -41,9 +40,10 @@ constexpr DaemonNames kNatpmpNames{"natpmpd",
                                    "runnatpmpportmapping",
                                    "/var/run/natpmpd.pid",
                                    "/var/run/natpmpd.lock",
-                                   "/var/tmp/natpmp_portmap.remap"};
+                                   "/var/tmp/natpmp_portmap.remap",
+                                   "/var/lib/tavo/natpmp_made.conf"};
 
-NatpmpMapper::NatpmpMapper() : RuleMapper(kNatpmpNames), mMade(kMadeFile) {}
+NatpmpMapper::NatpmpMapper() : RuleMapper(kNatpmpNames), mMade(kNatpmpNames.szMadeFile) {}
 
 // What was made here before is as doubtful as what was read from the file.
 void NatpmpMapper::NewGateway() {

@@ -24,15 +24,21 @@ constexpr auto kEcho = std::chrono::seconds(3);  // until what we have changed h
 
 }  // namespace
 
-constexpr DaemonNames kUpnpNames{
-    "upnpd", "UPnP", "runupnpportmapping", "/var/run/upnpd.pid", "/var/run/upnpd.lock", "/var/tmp/upnp_portmap.status"};
+constexpr DaemonNames kUpnpNames{"upnpd",
+                                 "UPnP",
+                                 "runupnpportmapping",
+                                 "/var/run/upnpd.pid",
+                                 "/var/run/upnpd.lock",
+                                 "/var/tmp/upnp_portmap.status",
+                                 kUpnpMadeFile};
 
-UpnpMapper::UpnpMapper() : RuleMapper(kUpnpNames), mMade(kUpnpMadeFile) {}
+UpnpMapper::UpnpMapper() : RuleMapper(kUpnpNames), mMade(kUpnpNames.szMadeFile) {}
 
 void UpnpMapper::NewGateway() {
     mPIgd.reset();
     mEvents.TurnTo(std::nullopt, "");
     KnownRouter known = RecallRouter(Gateway());
+    mKept = known;
     mPlace = std::move(known.place);
     mHabit.blPermanentOnly = known.blPermanentOnly;
     mBlNoGet = known.blNoGet;
@@ -91,7 +97,11 @@ void UpnpMapper::Remember() {
     if (const std::string& szHardware = mMade.Get().Router().szHardware; !szHardware.empty()) {
         mSzKnownHardware = szHardware;
     }
-    KeepRouter(Gateway(), {mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mBlNoGet, mHabit.blNoRanges});
+    KnownRouter known{mPlace, mSzKnownHardware, mHabit.blPermanentOnly, mBlNoGet, mHabit.blNoRanges};
+    if (mKept != known) {  // each look at the file reads it
+        KeepRouter(Gateway(), known);
+        mKept = std::move(known);
+    }
 }
 
 RouterName UpnpMapper::Name(const std::function<bool()>& fnStop) {

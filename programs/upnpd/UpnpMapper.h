@@ -10,6 +10,7 @@
 #include "programs/common/MadeFile.h"
 #include "programs/common/RuleMapper.h"
 #include "wire/upnp/Events.h"
+#include "wire/upnp/GatewayMemory.h"
 #include "wire/upnp/Igd.h"
 
 namespace tavo {
@@ -42,6 +43,7 @@ private:
     PassResult MapOnce(const std::vector<RouterMapping>& rgWanted, const std::function<bool()>& fnStop);
 
     IgdPlace mPlace;
+    KnownRouter mKept;             // what stands in the file of this gateway
     std::string mSzKnownHardware;  // of the router whose habits are known
     std::unique_ptr<Igd> mPIgd;
     Descriptor mFdLate;  // where nothing was found, what comes later is heard

@@ -31,8 +31,13 @@ using tavo::PassResult;
 using tavo::RouterMapping;
 using Lines = std::vector<std::string>;
 
-constexpr tavo::DaemonNames kNames = {"played",           "UPnP",           "runupnpportmapping", "/run/played.pid",
-                                      "/run/played.lock", "/tmp/played.out"};
+constexpr tavo::DaemonNames kNames = {"played",
+                                      "UPnP",
+                                      "runupnpportmapping",
+                                      "/run/played.pid",
+                                      "/run/played.lock",
+                                      "/tmp/played.out",
+                                      "/var/lib/tavo/playe_made.conf"};
 constexpr char kRules[] = "/etc/portforward/rule.conf";
 constexpr char kRule[] = "[1]\nenabled=1\nprotocol name=tcp\nr_port=80\ns_port=8080\nservice=web\n";
 constexpr char kSystem[] = "/etc/tavoinfo.conf";

@@ -49,7 +49,8 @@ TEST(SignalQueue, WhatAQuestionTookInEndsTheNextWaitAndNoFurtherOne) {
     signal(SIGPIPE, SIG_DFL);
 }
 
-constexpr tavo::DaemonNames kNames = {"played", "UPnP", "k", "/run/played.pid", "/run/played.lock", "/tmp/played.out"};
+constexpr tavo::DaemonNames kNames = {
+    "played", "UPnP", "k", "/run/played.pid", "/run/played.lock", "/tmp/played.out", "/var/lib/tavo/playe_made.conf"};
 constexpr char kMarker[] = "/tmp/pfProgress";
 constexpr char kMade[] = "[1]\ngateway=\"192.168.1.1\"\nprotocol=\"TCP\"\nrouter_port=\"80\"\nbox_port=\"80\"\n";
 constexpr char kElsewhere[] = "[1]\ngateway=\"10.0.0.1\"\nprotocol=\"TCP\"\nrouter_port=\"80\"\nbox_port=\"80\"\n";
@@ -73,7 +74,7 @@ public:
         while (mBlSlow && !fnStop()) {
         }
         if (!mBlSlow) {
-            std::filesystem::remove(tavo::MadeFileOf(kNames));
+            std::filesystem::remove(kNames.szMadeFile);
         }
         return !mBlSlow;
     }
@@ -259,7 +260,7 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         const pid_t pidEnds = one.nEnds == 0 ? 0 : HoldUntilTold(one.nEnds);
         tavo::Instance holder(kNames.szLockFile);
         ASSERT_TRUE(!one.blHeld || holder.Take());
-        Write(tavo::MadeFileOf(kNames), one.szMade);
+        Write(kNames.szMadeFile, one.szMade);
         Write(one.blHeld ? kNames.szLockFile : "/tmp/t/none", "x");  // it does not say who it is
         EXPECT_EQ(InChild([&] {
                       PlayedMapper mapper([&](int) { raise(one.blTerm ? SIGTERM : SIGUSR1); });
@@ -278,8 +279,8 @@ TEST(Daemon, SaysByItsExitStatusWhatBecameOfAnOption) {
         EXPECT_EQ(Read(kNames.szResultFile), one.szStory) << one.szOption;
         EXPECT_EQ(Read("/tmp/t/said").starts_with("Usage: played ["), &one == rgCases);
     }
-    EXPECT_EQ(tavo::MadeFileOf(tavo::kUpnpNames), tavo::kUpnpMadeFile);
-    EXPECT_EQ(tavo::MadeFileOf(tavo::kNatpmpNames), "/var/lib/tavo/natpmp_made.conf");
+    EXPECT_STREQ(tavo::kUpnpNames.szMadeFile, tavo::kUpnpMadeFile);
+    EXPECT_STREQ(tavo::kNatpmpNames.szMadeFile, "/var/lib/tavo/natpmp_made.conf");
     signal(SIGHUP, SIG_IGN);
     tavo::Instance parent(tavo::Watch::LockFile(kNames.szName));
     ASSERT_TRUE(parent.Take());
